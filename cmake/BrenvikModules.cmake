@@ -1,0 +1,77 @@
+# SPDX-License-Identifier: Apache-2.0
+# SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#
+# One folder, one static library. Each library shows its consumers a view of its own headers only (links in
+# the build tree, under the path they have in the source tree), so an include of a folder that is not
+# among a target's dependencies does not build. That is what keeps the arrows pointing one way.
+
+find_package(PkgConfig REQUIRED)
+find_package(Threads REQUIRED)
+pkg_check_modules(systemd REQUIRED IMPORTED_TARGET libsystemd)
+if(BUILD_TESTING)
+  find_package(GTest REQUIRED)
+endif()
+
+# brenvik_library(<target> [DEPENDS <what its headers use>...] [PRIVATE <what only its sources use>...])
+# Takes every .cpp of the folder but *Test.cpp, *Fuzz.cpp and main.cpp; a folder of headers only becomes an
+# INTERFACE library.
+function(brenvik_library target)
+  cmake_parse_arguments(ARG "" "" "DEPENDS;PRIVATE;SOURCES" ${ARGN})
+  file(GLOB sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*.cpp)
+  list(FILTER sources EXCLUDE REGEX "/([A-Za-z0-9]*(Test|Fuzz)|main)\\.cpp$")
+  list(APPEND sources ${ARG_SOURCES})
+  file(GLOB headers CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*.h)
+  file(RELATIVE_PATH folder ${PROJECT_SOURCE_DIR} ${CMAKE_CURRENT_SOURCE_DIR})
+  set(view ${PROJECT_BINARY_DIR}/views/${target})
+  file(REMOVE_RECURSE ${view})
+  file(MAKE_DIRECTORY ${view}/${folder})
+  foreach(header IN LISTS headers)
+    get_filename_component(name ${header} NAME)
+    file(CREATE_LINK ${header} ${view}/${folder}/${name} SYMBOLIC)
+  endforeach()
+  if(sources)
+    add_library(${target} STATIC ${sources})
+    target_include_directories(${target} PUBLIC ${view})
+    target_link_libraries(${target} PUBLIC ${ARG_DEPENDS} PRIVATE brenvik_flags ${ARG_PRIVATE})
+  else()
+    add_library(${target} INTERFACE)
+    target_include_directories(${target} INTERFACE ${view})
+    target_link_libraries(${target} INTERFACE ${ARG_DEPENDS})
+  endif()
+endfunction()
+
+# brenvik_tests(<target> [DEPENDS ...] [LABELS ...])
+# Builds <target>_tests of the folder's *Test.cpp and registers it with CTest.
+function(brenvik_tests target)
+  if(NOT BUILD_TESTING)
+    return()
+  endif()
+  cmake_parse_arguments(ARG "" "" "DEPENDS;LABELS" ${ARGN})
+  file(GLOB sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*Test.cpp)
+  add_executable(${target}_tests ${sources})
+  set_target_properties(${target}_tests PROPERTIES RUNTIME_OUTPUT_DIRECTORY ${PROJECT_BINARY_DIR}/unit)
+  target_link_libraries(${target}_tests PRIVATE brenvik_flags ${target} ${ARG_DEPENDS} GTest::gmock_main Threads::Threads)
+  add_test(NAME ${target} COMMAND ${target}_tests)
+  set_tests_properties(${target} PROPERTIES LABELS "unit;${ARG_LABELS}" TIMEOUT 300)
+endfunction()
+
+# brenvik_fuzz_target(<name> DEPENDS ...)
+# <name>.cpp of the folder defines LLVMFuzzerTestOneInput. With BRENVIK_FUZZ it becomes a libFuzzer program;
+# in every other build it replays the kept corpus, tests/corpus/<name>/, as a test.
+function(brenvik_fuzz_target name)
+  if(NOT BUILD_TESTING)
+    return()
+  endif()
+  cmake_parse_arguments(ARG "" "" "DEPENDS" ${ARGN})
+  set(corpus ${PROJECT_SOURCE_DIR}/tests/corpus/${name})
+  add_executable(${name} ${name}.cpp)
+  set_target_properties(${name} PROPERTIES RUNTIME_OUTPUT_DIRECTORY ${PROJECT_BINARY_DIR}/fuzz)
+  target_link_libraries(${name} PRIVATE brenvik_flags ${ARG_DEPENDS})
+  if(BRENVIK_FUZZ)
+    target_link_options(${name} PRIVATE -fsanitize=fuzzer)
+  else()
+    target_sources(${name} PRIVATE ${PROJECT_SOURCE_DIR}/tests/ReplayCorpus.cpp)
+    add_test(NAME ${name} COMMAND ${name} ${corpus})
+    set_tests_properties(${name} PROPERTIES LABELS "corpus" TIMEOUT 120)
+  endif()
+endfunction()

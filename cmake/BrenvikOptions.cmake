@@ -1,0 +1,64 @@
+# SPDX-License-Identifier: Apache-2.0
+# SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#
+# Build options, and every named place of the system as a cache variable. The places are compiled in:
+# the daemon reads no configuration and nothing of the environment but socket activation.
+
+set(BRENVIK_SANITIZE "" CACHE STRING "Sanitizers, as -fsanitize= takes them: address,undefined or thread")
+option(BRENVIK_FUZZ "Build the fuzz targets with libFuzzer (needs clang)" OFF)
+option(BRENVIK_BENCHMARKS "Build the benchmarks" OFF)
+option(BRENVIK_STATIC_RUNTIME "Link libstdc++ and libgcc statically into the daemon: 0.4 ms less at each start" OFF)
+option(BRENVIK_COVERAGE "Instrument for line and branch coverage (gcov)" OFF)
+
+set(BRENVIK_BOOTSTRAP_DIRECTORY "/run/brenvik/bootstrap" CACHE STRING "Socket files of named services")
+set(BRENVIK_ENTITLEMENT_DIRECTORIES "/etc/brenvik/entitlements.d;/usr/lib/brenvik/entitlements.d"
+    CACHE STRING "Entitlement files, earlier directories first")
+set(BRENVIK_LASD_HOST "lasd.norvale.example" CACHE STRING "Update server, HTTPS; host or host:port")
+set(BRENVIK_GEOCODER_URL "" CACHE STRING "Nominatim-compatible server; empty: none")
+set(BRENVIK_STUN_SERVER "stun.norvale.example:3478" CACHE STRING "STUN server for the public address")
+set(BRENVIK_GAZETTEER "/usr/share/brenvik/gazetteer.db" CACHE STRING "Offline place database")
+set(BRENVIK_COUNTRY_CONFIGURATION "/var/lib/brenvik/country.plist" CACHE STRING "Shared country configuration")
+set(BRENVIK_REACHABILITY_ADDRESS "192.0.2.1" CACHE STRING "Heartbeat destination, IPv4")
+set(BRENVIK_ANY_USER_PREFERENCES "/var/lib/brenvik/Library/Preferences"
+    CACHE STRING "Preference domains of the any-user scope")
+set(BRENVIK_VISUAL_VOICEMAIL_LIBRARY "libbrenvik-visualvoicemail.so.0" CACHE STRING "Subscription query: library")
+set(BRENVIK_VISUAL_VOICEMAIL_SYMBOL "_VisualVoicemailIsSubscribed" CACHE STRING "Subscription query: symbol")
+set(BRENVIK_BASEBAND_LIBRARY "libbrenvik-baseband-helper.so.0" CACHE STRING "Optional hosted baseband server")
+
+# Warnings are errors, in every build. A target that is ours links brenvik_flags.
+add_library(brenvik_flags INTERFACE)
+target_compile_options(brenvik_flags INTERFACE
+  -Wall -Wextra -Wpedantic -Werror -Wshadow -Wnon-virtual-dtor -Wold-style-cast -Wcast-align -Wunused
+  -Woverloaded-virtual -Wconversion -Wsign-conversion -Wdouble-promotion -Wformat=2 -Wimplicit-fallthrough
+  -fstack-protector-strong -fno-plt)
+target_compile_definitions(brenvik_flags INTERFACE _GNU_SOURCE)
+add_library(brenvik_c_flags INTERFACE)
+target_compile_options(brenvik_c_flags INTERFACE -Wall -Wextra -Wpedantic -Werror -Wshadow -Wconversion)
+
+if(BRENVIK_SANITIZE)
+  add_compile_options(-fsanitize=${BRENVIK_SANITIZE} -fno-omit-frame-pointer -fno-sanitize-recover=all)
+  add_link_options(-fsanitize=${BRENVIK_SANITIZE})
+endif()
+if(BRENVIK_COVERAGE)
+  add_compile_options(--coverage -fprofile-update=atomic)
+  add_link_options(--coverage)
+endif()
+if(BRENVIK_FUZZ)
+  if(NOT CMAKE_CXX_COMPILER_ID MATCHES Clang)
+    message(FATAL_ERROR "BRENVIK_FUZZ needs clang++: cmake --preset fuzz chooses it")
+  endif()
+  add_compile_options(-fsanitize=fuzzer-no-link,address,undefined -fno-omit-frame-pointer -fno-sanitize-recover=all)
+  add_link_options(-fsanitize=address,undefined)
+endif()
+if(NOT BRENVIK_SANITIZE AND NOT BRENVIK_FUZZ AND CMAKE_BUILD_TYPE STREQUAL "Release")
+  add_compile_definitions(_FORTIFY_SOURCE=2)
+  add_link_options(-Wl,-z,relro,-z,now -Wl,--as-needed -Wl,--gc-sections)
+  add_compile_options(-ffunction-sections -fdata-sections)
+endif()
+
+# ccache, where there is one, makes the sanitizer builds of a second run cheap.
+find_program(BRENVIK_CCACHE ccache)
+if(BRENVIK_CCACHE AND NOT CMAKE_CXX_COMPILER_LAUNCHER)
+  set(CMAKE_C_COMPILER_LAUNCHER ${BRENVIK_CCACHE})
+  set(CMAKE_CXX_COMPILER_LAUNCHER ${BRENVIK_CCACHE})
+endif()

@@ -1,0 +1,61 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/log/Log.h"
+
+#include <algorithm>
+#include <array>
+#include <atomic>
+#include <cerrno>
+#include <cstdarg>
+#include <cstdio>
+
+namespace brenvik {
+namespace {
+
+// A log line is for people; the longest text of the system with two 1,024-byte fields in it fits.
+constexpr std::size_t kLongestLine = 4096;
+
+std::atomic<LogSink*> currentSink{nullptr};
+
+class Line {
+ public:
+  [[gnu::format(printf, 2, 0)]] Line(const char* format, va_list arguments) noexcept {
+    const int wanted = std::vsnprintf(text_.data(), text_.size(), format, arguments);
+    if (wanted > 0) size_ = std::min(static_cast<std::size_t>(wanted), text_.size() - 1);
+  }
+  std::string_view view() const noexcept { return {text_.data(), size_}; }
+
+ private:
+  std::array<char, kLongestLine> text_;
+  std::size_t size_ = 0;
+};
+
+}  // namespace
+
+LogSink* setLogSink(LogSink* sink) noexcept { return currentSink.exchange(sink); }
+
+void logUnified(LogLevel level, const char* format, ...) noexcept {
+  LogSink* const sink = currentSink.load(std::memory_order_acquire);
+  if (sink == nullptr) return;
+  const int savedErrno = errno;
+  va_list arguments;
+  va_start(arguments, format);
+  const Line line(format, arguments);
+  va_end(arguments);
+  sink->unified(level, line.view());
+  errno = savedErrno;
+}
+
+void logBsd(SyslogPriority priority, const char* format, ...) noexcept {
+  LogSink* const sink = currentSink.load(std::memory_order_acquire);
+  if (sink == nullptr) return;
+  const int savedErrno = errno;
+  va_list arguments;
+  va_start(arguments, format);
+  const Line line(format, arguments);
+  va_end(arguments);
+  sink->bsd(priority, line.view());
+  errno = savedErrno;
+}
+
+}  // namespace brenvik

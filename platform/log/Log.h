@@ -1,0 +1,34 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <string_view>
+
+namespace brenvik {
+
+// Levels of the unified log, with the priority each has in the journal.
+enum class LogLevel : int { error = 3, standard = 5, info = 6, debug = 7 };
+
+// Priorities of the BSD log, as syslog(3) numbers them.
+enum class SyslogPriority : int { error = 3, notice = 5 };
+
+// Where finished lines go. Implementations are called from any thread and never throw, block on a reader or
+// call back into the log. `line` is the whole text as written by the helper, control characters included;
+// escaping what a terminal or a log reader could misread is the sink's work.
+class LogSink {
+ public:
+  virtual ~LogSink() = default;
+  virtual void unified(LogLevel level, std::string_view line) noexcept = 0;
+  virtual void bsd(SyslogPriority priority, std::string_view line) noexcept = 0;
+};
+
+// Replaces the process-wide sink; returns the previous one. The sink must outlive its use; null discards
+// every line. Call it before other threads log.
+LogSink* setLogSink(LogSink* sink) noexcept;
+
+// Write one line to the unified log or to the BSD log. Any thread. A line longer than 4,096 bytes is cut.
+// Nothing is allocated; errno is left as it was.
+[[gnu::format(printf, 2, 3)]] void logUnified(LogLevel level, const char* format, ...) noexcept;
+[[gnu::format(printf, 2, 3)]] void logBsd(SyslogPriority priority, const char* format, ...) noexcept;
+
+}  // namespace brenvik

@@ -1,0 +1,68 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <mutex>
+#include <ostream>
+#include <string>
+#include <vector>
+
+#include "platform/log/Log.h"
+
+namespace brenvik {
+
+// Records every line with its channel and level while it lives, then puts the previous sink back.
+// Any thread may log; read the lines when the work under test has ended.
+class RecordingLog final : public LogSink {
+ public:
+  struct Entry {
+    enum class Channel { unified, bsd };
+    Channel channel;
+    int level;  // the number of LogLevel or SyslogPriority
+    std::string line;
+    bool operator==(const Entry&) const = default;
+  };
+
+  RecordingLog() : previous_(setLogSink(this)) {}
+  RecordingLog(const RecordingLog&) = delete;
+  RecordingLog& operator=(const RecordingLog&) = delete;
+  ~RecordingLog() override { setLogSink(previous_); }
+
+  void unified(LogLevel level, std::string_view line) noexcept override {
+    const std::lock_guard lock(mutex_);
+    entries_.push_back({Entry::Channel::unified, static_cast<int>(level), std::string(line)});
+  }
+  void bsd(SyslogPriority priority, std::string_view line) noexcept override {
+    const std::lock_guard lock(mutex_);
+    entries_.push_back({Entry::Channel::bsd, static_cast<int>(priority), std::string(line)});
+  }
+
+  std::vector<Entry> entries() const {
+    const std::lock_guard lock(mutex_);
+    return entries_;
+  }
+  void clear() {
+    const std::lock_guard lock(mutex_);
+    entries_.clear();
+  }
+
+  static Entry unifiedLine(LogLevel level, std::string line) {
+    return {Entry::Channel::unified, static_cast<int>(level), std::move(line)};
+  }
+  static Entry bsdLine(SyslogPriority priority, std::string line) {
+    return {Entry::Channel::bsd, static_cast<int>(priority), std::move(line)};
+  }
+
+ private:
+  LogSink* const previous_;
+  mutable std::mutex mutex_;
+  std::vector<Entry> entries_;
+};
+
+// So that a failed assertion shows the line and not its bytes.
+inline void PrintTo(const RecordingLog::Entry& entry, std::ostream* out) {
+  *out << (entry.channel == RecordingLog::Entry::Channel::unified ? "unified" : "bsd") << "/" << entry.level
+       << " \"" << entry.line << "\"";
+}
+
+}  // namespace brenvik

@@ -1,0 +1,28 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include "platform/log/Log.h"
+
+namespace brenvik {
+
+// The unified log on the systemd journal (sd_journal_send(3)), or on standard error with the <N> priority
+// prefix of sd-daemon(3) while there is no journal socket; the BSD log on syslog(3), facility daemon. Lines
+// are escaped: a control character or a byte that is not UTF-8 is written as \xNN, one trailing newline of a
+// BSD line is dropped. Any thread.
+class SystemLog final : public LogSink {
+ public:
+  // `identifier` is kept, not copied: a string literal.
+  explicit SystemLog(const char* identifier) noexcept;
+  ~SystemLog() override;
+  SystemLog(const SystemLog&) = delete;
+  SystemLog& operator=(const SystemLog&) = delete;
+
+  void unified(LogLevel level, std::string_view line) noexcept override;
+  void bsd(SyslogPriority priority, std::string_view line) noexcept override;
+
+ private:
+  const char* const identifier_;
+};
+
+}  // namespace brenvik
