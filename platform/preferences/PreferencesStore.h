@@ -1,0 +1,47 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <string>
+#include <string_view>
+
+#include "platform/plist/PropertyList.h"
+
+namespace brenvik {
+
+enum class UserScope { currentUser, anyUser };
+enum class HostScope { currentHost, anyHost };
+
+// The platform's preferences: values by domain, key, user scope and host scope. Any thread. Texts are UTF-8.
+//
+// A set value is seen by this process at once and by other processes after synchronize(), which also takes
+// over what they have written. A domain that names no file (empty, "." or "..", or with a '/') reads as
+// having no values; writing it stores nothing and logs an error.
+class PreferencesStore {
+ public:
+  virtual ~PreferencesStore() = default;
+
+  // Sets the key's value; no value removes the key.
+  virtual void setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
+                        HostScope host) noexcept = 0;
+
+  // Makes what was set durable and reads what others wrote. False when something set could not be stored; it
+  // is then dropped, so that what is read is what is stored.
+  virtual bool synchronize(std::string_view domain, UserScope user, HostScope host) noexcept = 0;
+
+  // The key's value in exactly this scope, or none.
+  virtual PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
+                                 HostScope host) noexcept = 0;
+
+  // Application scope: current user and current host, then current user and any host, then any user and any
+  // host; the first that has the key gives the value.
+  virtual bool synchronizeApplication(std::string_view domain) noexcept = 0;
+  virtual PropertyList copyApplicationValue(std::string_view key, std::string_view domain) noexcept = 0;
+
+  // Forgets what is cached of the domain for any user and of every host, so that the next read goes to the
+  // files. `domain` null: of no domain in particular, which flushes nothing. Values set and not yet
+  // synchronized are kept.
+  virtual void flushCachesForAnyUser(const std::string* domain) noexcept = 0;
+};
+
+}  // namespace brenvik

@@ -1,0 +1,89 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "platform/runloop/RunLoop.h"
+
+namespace brenvik {
+
+// How urgent a queue's work is: `standard` leaves the thread as it is; `utility` gives it nice 10 and the
+// lowest best-effort I/O priority.
+enum class QualityOfService { standard, utility };
+
+// A serial queue: tasks run one at a time, in the order posted. All members may be called from any thread.
+// Destroying the last reference to a queue lets the task that runs finish, drops the tasks and timers that
+// have not started, and joins the queue's thread (unless it is destroyed on that very thread).
+class WorkQueue {
+ public:
+  using Task = std::function<void()>;
+
+  virtual ~WorkQueue() = default;
+
+  virtual const std::string& label() const noexcept = 0;
+
+  virtual void post(Task task) = 0;
+
+  // Runs the task once, `delay` from now (a clock that counts while the system sleeps). It cannot be cancelled.
+  virtual void postAfter(std::chrono::nanoseconds delay, Task task) = 0;
+
+  // A timer whose handler runs on this queue: first after `first`, then every `interval`; a firing may be put
+  // off by up to `leeway` so that wake-ups coincide. Ticks that fall while the handler runs become one. The
+  // timer is inactive until activated. Null when it cannot be made.
+  class Timer {
+   public:
+    virtual ~Timer() = default;  // cancels
+    virtual void activate() = 0;
+    virtual void cancel() noexcept = 0;
+  };
+  virtual std::unique_ptr<Timer> makeTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
+                                           std::chrono::nanoseconds leeway, Task handler) = 0;
+
+  // True on the thread (or within the manual run) that runs this queue's tasks.
+  virtual bool isCurrent() const noexcept = 0;
+
+  // Watches a descriptor on this queue, level-triggered: for drivers of libraries that poll. To be called and
+  // destroyed on the queue itself. Null when the kernel refused or the queue has no descriptors (fakes).
+  virtual std::unique_ptr<DescriptorSource> watchDescriptor(int fd, std::uint32_t events,
+                                                            RunLoop::DescriptorHandler handler) = 0;
+};
+
+// Watches one process and tells, once, on the queue it was made with, that it has exited.
+class ProcessExitSource {
+ public:
+  virtual ~ProcessExitSource() = default;  // cancels without calling the cancel handler
+  virtual void activate() = 0;
+  // Ends the watching. The cancel handler runs once, afterwards, on the queue.
+  virtual void cancel() noexcept = 0;
+};
+
+// Makes queues. Any thread.
+class WorkQueues {
+ public:
+  virtual ~WorkQueues() = default;
+
+  // The queue served by the main thread's run loop.
+  virtual WorkQueue& main() noexcept = 0;
+
+  // The process-wide default-priority queue for short handlers.
+  virtual WorkQueue& global() noexcept = 0;
+
+  // A new serial queue; its thread starts with its first task. Never null.
+  virtual std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) = 0;
+
+  // Watches the process `pid` whose start time (field 22 of /proc/PID/stat, low 32 bits) is `startTime`. The
+  // event handler runs on global(); at once when that process is gone already or the id names another one.
+  // Null when the kernel gives no descriptor for it.
+  virtual std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t startTime,
+                                                                   WorkQueue::Task onExit,
+                                                                   WorkQueue::Task onCancel) = 0;
+};
+
+}  // namespace brenvik
