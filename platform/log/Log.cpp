@@ -34,7 +34,7 @@ class Line {
 
 LogSink* setLogSink(LogSink* sink) noexcept { return currentSink.exchange(sink); }
 
-void logUnified(LogLevel level, const char* format, ...) noexcept {
+void logUnifiedAt(const LogPlace& place, LogLevel level, const char* format, ...) noexcept {
   LogSink* const sink = currentSink.load(std::memory_order_acquire);
   if (sink == nullptr) return;
   const int savedErrno = errno;
@@ -42,7 +42,7 @@ void logUnified(LogLevel level, const char* format, ...) noexcept {
   va_start(arguments, format);
   const Line line(format, arguments);
   va_end(arguments);
-  sink->unified(level, line.view());
+  sink->unified(level, line.view(), place);
   errno = savedErrno;
 }
 

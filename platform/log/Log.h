@@ -12,13 +12,20 @@ enum class LogLevel : int { error = 3, standard = 5, info = 6, debug = 7 };
 // Priorities of the BSD log, as syslog(3) numbers them.
 enum class SyslogPriority : int { error = 3, notice = 5 };
 
+// Where in the source a line was written.
+struct LogPlace {
+  const char* file;
+  int line;
+  const char* function;
+};
+
 // Where finished lines go. Implementations are called from any thread and never throw, block on a reader or
 // call back into the log. `line` is the whole text as written by the helper, control characters included;
 // escaping what a terminal or a log reader could misread is the sink's work.
 class LogSink {
  public:
   virtual ~LogSink() = default;
-  virtual void unified(LogLevel level, std::string_view line) noexcept = 0;
+  virtual void unified(LogLevel level, std::string_view line, const LogPlace& place) noexcept = 0;
   virtual void bsd(SyslogPriority priority, std::string_view line) noexcept = 0;
 };
 
@@ -27,8 +34,10 @@ class LogSink {
 LogSink* setLogSink(LogSink* sink) noexcept;
 
 // Write one line to the unified log or to the BSD log. Any thread. A line longer than 4,096 bytes is cut.
-// Nothing is allocated; errno is left as it was.
-[[gnu::format(printf, 2, 3)]] void logUnified(LogLevel level, const char* format, ...) noexcept;
+// Nothing is allocated; errno is left as it was. logUnified(level, format, ...) is a macro only so that the
+// journal can say where the line came from.
+#define logUnified(...) ::brenvik::logUnifiedAt({__FILE__, __LINE__, __func__}, __VA_ARGS__)
+[[gnu::format(printf, 3, 4)]] void logUnifiedAt(const LogPlace& place, LogLevel level, const char* format, ...) noexcept;
 [[gnu::format(printf, 2, 3)]] void logBsd(SyslogPriority priority, const char* format, ...) noexcept;
 
 }  // namespace brenvik

@@ -28,7 +28,7 @@ class RecordingLog final : public LogSink {
   RecordingLog& operator=(const RecordingLog&) = delete;
   ~RecordingLog() override { setLogSink(previous_); }
 
-  void unified(LogLevel level, std::string_view line) noexcept override {
+  void unified(LogLevel level, std::string_view line, const LogPlace&) noexcept override {
     const std::lock_guard lock(mutex_);
     entries_.push_back({Entry::Channel::unified, static_cast<int>(level), std::string(line)});
   }

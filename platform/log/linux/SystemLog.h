@@ -18,7 +18,7 @@ class SystemLog final : public LogSink {
   SystemLog(const SystemLog&) = delete;
   SystemLog& operator=(const SystemLog&) = delete;
 
-  void unified(LogLevel level, std::string_view line) noexcept override;
+  void unified(LogLevel level, std::string_view line, const LogPlace& place) noexcept override;
   void bsd(SyslogPriority priority, std::string_view line) noexcept override;
 
  private:

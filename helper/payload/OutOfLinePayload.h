@@ -1,0 +1,32 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstdint>
+#include <cstring>
+#include <string_view>
+
+#include "platform/ipc/RegionAllocator.h"
+
+namespace brenvik {
+
+// A serialized property list (XML, no terminating NUL) in a region of its own, on its way to a caller. On
+// success it travels out of line with the reply, and the caller owns it there. Address and length 0: no value.
+struct OutOfLinePayload {
+  void* address = nullptr;
+  std::uint32_t length = 0;  // bytes
+};
+
+// Copies already serialized bytes into a fresh region. payload->length is set in any case, payload->address
+// only on success; else the allocator's code is returned and nothing is left to free.
+inline KernelReturn fillPayload(RegionAllocator& regions, std::string_view bytes, OutOfLinePayload* payload) noexcept {
+  payload->length = static_cast<std::uint32_t>(bytes.size());
+  void* address = nullptr;
+  const KernelReturn code = regions.allocate(&address, bytes.size());
+  if (code != kern::success) return code;
+  payload->address = address;
+  if (address != nullptr) std::memcpy(address, bytes.data(), bytes.size());
+  return kern::success;
+}
+
+}  // namespace brenvik

@@ -1,0 +1,112 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/log/linux/SystemLog.h"
+
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/uio.h>
+#include <sys/un.h>
+#include <syslog.h>
+#include <systemd/sd-journal.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cstdio>
+#include <cstring>
+
+#include "platform/base/Utf8.h"
+
+namespace brenvik {
+namespace {
+
+constexpr char kJournalSocket[] = "/run/systemd/journal/socket";
+
+// A finished line with everything escaped that could forge another line or drive a terminal.
+class EscapedLine {
+ public:
+  explicit EscapedLine(std::string_view line) noexcept {
+    const bool utf8 = isValidUtf8(line);
+    for (const char c : line) {
+      const auto byte = static_cast<unsigned char>(c);
+      if (byte < 0x20 || byte == 0x7F || (byte >= 0x80 && !utf8)) {
+        if (size_ + 4 >= text_.size()) break;
+        std::snprintf(text_.data() + size_, 5, "\\x%02x", static_cast<unsigned>(byte));
+        size_ += 4;
+      } else {
+        if (size_ + 1 >= text_.size()) break;
+        text_[size_++] = c;
+      }
+    }
+    text_[size_] = '\0';
+  }
+  const char* text() const noexcept { return text_.data(); }
+  std::string_view view() const noexcept { return {text_.data(), size_}; }
+
+ private:
+  std::array<char, 8192> text_;
+  std::size_t size_ = 0;
+};
+
+// One KEY=value field of a journal entry.
+class Field {
+ public:
+  Field(std::string_view key, std::string_view value) noexcept {
+    append(key);
+    append("=");
+    append(value);
+  }
+  iovec io() const noexcept { return {const_cast<char*>(text_.data()), size_}; }
+
+ private:
+  void append(std::string_view part) noexcept {
+    const std::size_t count = std::min(part.size(), text_.size() - size_);
+    std::memcpy(text_.data() + size_, part.data(), count);
+    size_ += count;
+  }
+  std::array<char, 8200> text_;
+  std::size_t size_ = 0;
+};
+
+// Asked anew for each line, because the journal may start after the daemon; a stat costs less than the line.
+bool journalIsThere() noexcept {
+  struct stat status{};
+  return ::stat(kJournalSocket, &status) == 0 && S_ISSOCK(status.st_mode);
+}
+
+}  // namespace
+
+SystemLog::SystemLog(const char* identifier) noexcept : identifier_(identifier) {
+  ::openlog(identifier_, 0, LOG_DAEMON);
+}
+
+SystemLog::~SystemLog() { ::closelog(); }
+
+void SystemLog::unified(LogLevel level, std::string_view line, const LogPlace& place) noexcept {
+  const EscapedLine escaped(line);
+  if (journalIsThere()) {
+    const char digit = static_cast<char>('0' + static_cast<int>(level));
+    std::array<char, 12> number;
+    const int digits = std::snprintf(number.data(), number.size(), "%d", place.line);
+    const Field message("MESSAGE", escaped.view());
+    const Field priority("PRIORITY", {&digit, 1});
+    const Field identifier("SYSLOG_IDENTIFIER", identifier_);
+    const Field file("CODE_FILE", place.file);
+    const Field codeLine("CODE_LINE", {number.data(), static_cast<std::size_t>(digits)});
+    const Field function("CODE_FUNC", place.function);
+    const std::array fields{message.io(), priority.io(), identifier.io(), file.io(), codeLine.io(), function.io()};
+    if (::sd_journal_sendv(fields.data(), static_cast<int>(fields.size())) >= 0) return;
+  }
+  std::array<char, 8200> text;
+  const int size = std::snprintf(text.data(), text.size(), "<%d>%s\n", static_cast<int>(level), escaped.text());
+  // One write a line, so that lines of several threads do not mix; there is nobody to tell when it fails.
+  (void)!::write(STDERR_FILENO, text.data(), static_cast<std::size_t>(size));
+}
+
+void SystemLog::bsd(SyslogPriority priority, std::string_view line) noexcept {
+  if (line.ends_with('\n')) line.remove_suffix(1);
+  const EscapedLine escaped(line);
+  ::syslog(LOG_DAEMON | static_cast<int>(priority), "%s", escaped.text());
+}
+
+}  // namespace brenvik
