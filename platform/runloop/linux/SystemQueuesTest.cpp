@@ -1,0 +1,268 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/runloop/linux/SystemQueues.h"
+
+#include <gtest/gtest.h>
+#include <fcntl.h>
+#include <sys/epoll.h>
+#include <sys/resource.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <array>
+#include <future>
+#include <limits>
+
+#include "platform/base/ProcessStartTime.h"
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+constexpr std::chrono::duration<double> kNoTimeOut{std::numeric_limits<double>::max()};
+
+class SystemQueuesTest : public testing::Test {
+ protected:
+  void SetUp() override { ASSERT_NE(loop, nullptr); }
+  // Runs the loop until `done` is true; a test that waits for nothing fails instead of hanging.
+  void runUntil(const std::function<bool()>& done) {
+    while (!done()) ASSERT_NE(loop->run(20s, ReturnAfterSource::yes), RunResult::timedOut);
+  }
+  std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
+};
+
+TEST_F(SystemQueuesTest, ReturnsAfterASourceWasHandled) {
+  std::array<int, 2> pipe{};
+  ASSERT_EQ(::pipe2(pipe.data(), O_CLOEXEC), 0);
+  const UniqueFd read(pipe[0]);
+  const UniqueFd write(pipe[1]);
+  int handled = 0;
+  const auto source = loop->addDescriptor(read.get(), EPOLLIN, [&](std::uint32_t events) {
+    EXPECT_TRUE(events & EPOLLIN);
+    char byte = 0;
+    EXPECT_EQ(::read(read.get(), &byte, 1), 1);
+    ++handled;
+  });
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::timedOut);
+  ASSERT_EQ(::write(write.get(), "x", 1), 1);
+  EXPECT_EQ(loop->run(kNoTimeOut, ReturnAfterSource::yes), RunResult::handledSource);
+  EXPECT_EQ(handled, 1);
+}
+
+TEST_F(SystemQueuesTest, StopEndsARunFromAnyThreadAndAlsoTheNextRun) {
+  std::thread other([&] { loop->stop(); });
+  EXPECT_EQ(loop->run(kNoTimeOut, ReturnAfterSource::no), RunResult::stopped);
+  other.join();
+  loop->stop();
+  EXPECT_EQ(loop->run(kNoTimeOut, ReturnAfterSource::no), RunResult::stopped);
+}
+
+TEST_F(SystemQueuesTest, TimeOutEndsARunThatHasNothingToDo) {
+  const auto before = std::chrono::steady_clock::now();
+  EXPECT_EQ(loop->run(20ms, ReturnAfterSource::no), RunResult::timedOut);
+  EXPECT_GE(std::chrono::steady_clock::now() - before, 20ms);
+}
+
+TEST_F(SystemQueuesTest, RepeatingTimerFiresUntilItsHandlerDestroysIt) {
+  int fired = 0;
+  std::unique_ptr<LoopSource> timer;
+  timer = loop->addTimer(
+      1ms, 1ms,
+      [&] {
+        if (++fired == 3) timer.reset();
+      },
+      {});
+  runUntil([&] { return fired == 3; });
+  EXPECT_EQ(loop->run(20ms, ReturnAfterSource::no), RunResult::timedOut);
+  EXPECT_EQ(fired, 3);
+}
+
+TEST_F(SystemQueuesTest, ADescriptorThatIsReadyIsServedBeforeATimerThatIsDue) {
+  std::array<int, 2> pipe{};
+  ASSERT_EQ(::pipe2(pipe.data(), O_CLOEXEC), 0);
+  const UniqueFd read(pipe[0]);
+  const UniqueFd write(pipe[1]);
+  std::string order;
+  const auto timer = loop->addTimer(0s, 0s, [&] { order += 't'; }, {});
+  std::unique_ptr<DescriptorSource> source;
+  source = loop->addDescriptor(read.get(), EPOLLIN, [&](std::uint32_t) {
+    order += 'd';
+    source.reset();
+  });
+  ASSERT_EQ(::write(write.get(), "x", 1), 1);
+  runUntil([&] { return order.size() == 2; });
+  EXPECT_EQ(order, "dt");
+}
+
+TEST_F(SystemQueuesTest, TimerOfAnotherThreadFiresOnTheLoopAndCanBeCancelledThere) {
+  std::unique_ptr<LoopSource> kept;
+  std::thread::id firedOn;
+  std::thread other([&] {
+    kept = loop->addTimer(1ms, 0s, [&] { firedOn = std::this_thread::get_id(); }, {});
+    auto cancelled = loop->addTimer(0s, 0s, [] { ADD_FAILURE() << "cancelled, and fired"; }, {});
+    cancelled.reset();
+  });
+  other.join();
+  runUntil([&] { return firedOn != std::thread::id(); });
+  EXPECT_EQ(firedOn, std::this_thread::get_id());
+}
+
+TEST_F(SystemQueuesTest, MainQueueRunsTasksInOrderOnTheLoop) {
+  SystemQueues queues(*loop);
+  std::string order;
+  queues.main().post([&] { order += 'a'; });
+  std::thread other([&] { queues.main().post([&] { order += 'b'; }); });
+  other.join();
+  queues.main().postAfter(1ms, [&] { order += 'c'; });
+  runUntil([&] { return order.size() == 3; });
+  EXPECT_EQ(order, "abc");
+  EXPECT_TRUE(queues.main().isCurrent());
+}
+
+TEST_F(SystemQueuesTest, SerialQueueRunsItsTasksInOrderOnOneThreadOfItsOwn) {
+  SystemQueues queues(*loop);
+  const auto queue = queues.makeSerial("a label longer than sixteen characters", QualityOfService::standard);
+  EXPECT_EQ(queue->label(), "a label longer than sixteen characters");
+  std::vector<int> order;
+  std::promise<std::thread::id> done;
+  for (int i = 0; i < 100; ++i) queue->post([&order, i] { order.push_back(i); });
+  queue->post([&] {
+    EXPECT_TRUE(queue->isCurrent());
+    done.set_value(std::this_thread::get_id());
+  });
+  EXPECT_NE(done.get_future().get(), std::this_thread::get_id());
+  ASSERT_EQ(order.size(), 100U);
+  EXPECT_TRUE(std::is_sorted(order.begin(), order.end()));
+}
+
+TEST_F(SystemQueuesTest, UtilityQueueIsNicerThanTheRest) {
+  SystemQueues queues(*loop);
+  const auto queue = queues.makeSerial("utility", QualityOfService::utility);
+  std::promise<std::pair<int, long>> done;
+  queue->post([&] {
+    const auto self = static_cast<id_t>(::syscall(SYS_gettid));
+    done.set_value({::getpriority(PRIO_PROCESS, self), ::syscall(SYS_ioprio_get, 1, 0)});
+  });
+  const auto [nice, ioPriority] = done.get_future().get();
+  EXPECT_EQ(nice, std::min(19, ::getpriority(PRIO_PROCESS, 0) + 10));
+  EXPECT_EQ(ioPriority, (2 << 13) | 7);
+}
+
+TEST_F(SystemQueuesTest, DestroyingAQueueLetsTheRunningTaskFinishAndDropsTheRest) {
+  SystemQueues queues(*loop);
+  auto queue = queues.makeSerial("short", QualityOfService::standard);
+  std::promise<void> started;
+  std::promise<void> goOn;
+  std::atomic<bool> finished = false;
+  queue->post([&] {
+    started.set_value();
+    goOn.get_future().wait();
+    finished = true;
+  });
+  started.get_future().wait();
+  queue->post([] { ADD_FAILURE() << "dropped with the queue, and ran"; });
+  std::thread destroyer([&] { queue.reset(); });
+  // The destroyer cannot have ended before the task; give it the chance to get it wrong.
+  goOn.set_value();
+  destroyer.join();
+  EXPECT_TRUE(finished);
+}
+
+TEST_F(SystemQueuesTest, AQueueMayBeDestroyedByItsOwnTask) {
+  SystemQueues queues(*loop);
+  std::promise<void> destroyed;
+  {
+    auto holder = std::make_shared<std::shared_ptr<WorkQueue>>(queues.makeSerial("own", QualityOfService::standard));
+    auto& queue = **holder;
+    queue.post([holder, &destroyed] {
+      holder->reset();
+      destroyed.set_value();
+    });
+  }
+  destroyed.get_future().wait();
+}
+
+TEST_F(SystemQueuesTest, QueueTimerRepeatsOnTheQueueUntilCancelled) {
+  SystemQueues queues(*loop);
+  const auto queue = queues.makeSerial("ticks", QualityOfService::standard);
+  std::promise<void> three;
+  int fired = 0;
+  std::unique_ptr<WorkQueue::Timer> timer;
+  timer = queue->makeTimer(0s, 1ms, 5us, [&] {
+    EXPECT_TRUE(queue->isCurrent());
+    if (++fired == 3) {
+      timer->cancel();
+      three.set_value();
+    }
+  });
+  timer->activate();
+  three.get_future().wait();
+}
+
+class ProcessExitTest : public SystemQueuesTest {
+ protected:
+  // A child that lives until the returned descriptor is closed.
+  std::pair<pid_t, UniqueFd> child() {
+    std::array<int, 2> pipe{};
+    EXPECT_EQ(::pipe2(pipe.data(), O_CLOEXEC), 0);
+    const pid_t pid = ::fork();
+    if (pid == 0) {
+      ::close(pipe[1]);
+      char byte = 0;
+      (void)!::read(pipe[0], &byte, 1);
+      ::_exit(0);
+    }
+    ::close(pipe[0]);
+    return {pid, UniqueFd(pipe[1])};
+  }
+};
+
+TEST_F(ProcessExitTest, TellsOnceThatTheProcessHasExited) {
+  SystemQueues queues(*loop);
+  auto [pid, life] = child();
+  std::promise<bool> told;
+  const auto source = queues.makeProcessExitSource(
+      pid, processStartTime(pid).value(), [&] { told.set_value(queues.global().isCurrent()); }, {});
+  ASSERT_NE(source, nullptr);
+  source->activate();
+  life.reset();
+  EXPECT_TRUE(told.get_future().get());
+  ::waitpid(pid, nullptr, 0);
+}
+
+TEST_F(ProcessExitTest, TellsAtOnceWhenTheProcessIsGoneOrTheIdNamesAnother) {
+  SystemQueues queues(*loop);
+  auto [pid, life] = child();
+  const std::uint32_t startTime = processStartTime(pid).value();
+  std::promise<void> another;
+  const auto wrong = queues.makeProcessExitSource(pid, startTime + 1, [&] { another.set_value(); }, {});
+  wrong->activate();
+  another.get_future().wait();
+  life.reset();
+  ::waitpid(pid, nullptr, 0);
+  std::promise<void> gone;
+  const auto source = queues.makeProcessExitSource(pid, startTime, [&] { gone.set_value(); }, {});
+  ASSERT_NE(source, nullptr);
+  source->activate();
+  gone.get_future().wait();
+}
+
+TEST_F(ProcessExitTest, CancelRunsItsHandlerOnceAndTheExitIsNotTold) {
+  SystemQueues queues(*loop);
+  auto [pid, life] = child();
+  std::promise<void> cancelled;
+  auto source = queues.makeProcessExitSource(
+      pid, processStartTime(pid).value(), [] { ADD_FAILURE() << "cancelled, and told"; },
+      [&] { cancelled.set_value(); });
+  source->activate();
+  source->cancel();
+  source->cancel();
+  cancelled.get_future().wait();
+  life.reset();
+  ::waitpid(pid, nullptr, 0);
+  source.reset();
+}
+
+}  // namespace
+}  // namespace brenvik
