@@ -1,0 +1,522 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "Helper/Shared/Server/HelperServerUtils.h"
+
+#include <gtest/gtest.h>
+
+#include <array>
+#include <cstring>
+
+#include "platform/ipc/fakes/FakePorts.h"
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/runloop/fakes/ManualRunLoop.h"
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+
+class NoRoutines final : public RoutineTable {
+ public:
+  Handler find(std::int32_t) const noexcept override { return nullptr; }
+  void* context() const noexcept override { return nullptr; }
+};
+
+class ServerTest : public testing::Test {
+ protected:
+  ~ServerTest() override { DestroyServer(server); }
+
+  void create() {
+    server = CreateServer(platform, kServiceName, routines);
+    ASSERT_NE(server, nullptr);
+  }
+
+  KernelReturn checkIn() {
+    callerPort = ports.adoptSendRight();
+    return BVMobileHelperCheckIn(registry, platform, server->servicePort, callerPort, &clientPort, AuditToken{});
+  }
+  // The client whose check-in was the n-th dies.
+  void clientDies(std::size_t n) { sources.deathWatches.at(n)->tellDeath(); }
+  bool idleTimerRuns() const { return loop.timers() == 1; }
+
+  ManualClock clock;
+  ManualRunLoop loop{clock};
+  FakePortSpace ports;
+  FakeBootstrap bootstrap{ports};
+  FakePortSources sources;
+  PortServerRegistry registry;
+  bool entitled = true;
+  std::string askedEntitlement;
+  ServerPlatform platform{ports, bootstrap, sources, loop,
+                          [this](const char* name, const AuditToken&) {
+                            askedEntitlement = name;
+                            return entitled;
+                          },
+                          registry};
+  NoRoutines routines;
+  ServerContext* server = nullptr;
+  PortName callerPort = kNullPort;
+  PortName clientPort = kNullPort;
+  RecordingLog log;
+};
+
+// ---- creation and destruction ----
+
+TEST_F(ServerTest, CreationChecksTheServiceNameInAndServesCheckInsOnItsPort) {
+  create();
+  EXPECT_EQ(bootstrap.name, "com.norvale.brenvik.mobile-helper");
+  EXPECT_EQ(registry.lookUp(server->servicePort), server);
+  ASSERT_EQ(sources.routineSources.size(), 1U);
+  const auto& source = *sources.routineSources[0];
+  EXPECT_EQ(source.port, server->servicePort);
+  EXPECT_TRUE(source.added);
+  EXPECT_EQ(source.wantTrailer, WantTrailer::yes);
+  EXPECT_NE(source.table.find(4792174), nullptr);
+  EXPECT_EQ(source.table.find(4792173), nullptr);
+  EXPECT_EQ(source.table.find(8683549), nullptr);
+  EXPECT_FALSE(idleTimerRuns());
+}
+
+TEST_F(ServerTest, ARefusedServiceNameIsLoggedAndLeavesNothing) {
+  bootstrap.refuseWith = kern::noAccess;
+  EXPECT_EQ(CreateServer(platform, kServiceName, routines), nullptr);
+  EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                               LogLevel::error, "unable to create server objects - out of resources")});
+  EXPECT_EQ(registry.size(), 0U);
+}
+
+TEST_F(ServerTest, AMissingServiceSourceDropsThePortTwiceAndTheSecondTimeToNoEffect) {
+  sources.refuseRoutineSources = true;
+  EXPECT_EQ(CreateServer(platform, kServiceName, routines), nullptr);
+  EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                               LogLevel::error, "unable to create server objects - out of resources")});
+  EXPECT_TRUE(ports.receiveRights.empty());
+  EXPECT_EQ(ports.failedDrops, 1);
+  EXPECT_EQ(registry.size(), 0U);
+}
+
+TEST_F(ServerTest, AServiceSourceThatTheLoopRefusesFailsTheCreation) {
+  sources.refuseToBeAdded = true;
+  EXPECT_EQ(CreateServer(platform, kServiceName, routines), nullptr);
+  EXPECT_TRUE(ports.receiveRights.empty());
+}
+
+TEST_F(ServerTest, DestructionTearsEveryClientDownAndGivesThePortBack) {
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  ASSERT_EQ(checkIn(), kern::success);
+  DestroyServer(std::exchange(server, nullptr));
+  EXPECT_EQ(registry.size(), 0U);
+  EXPECT_TRUE(ports.receiveRights.empty());
+  EXPECT_TRUE(ports.sendRights.empty());
+  EXPECT_EQ(ports.failedDrops, 0);
+  for (const auto& source : sources.routineSources) EXPECT_FALSE(source->valid);
+  EXPECT_FALSE(idleTimerRuns());
+}
+
+// ---- run and stop ----
+
+TEST_F(ServerTest, RunServerOnAContextWhoseStopFlagIsSetReturns0WithoutRunningTheLoop) {
+  create();
+  EXPECT_EQ(StopServer(*server), 0);
+  EXPECT_EQ(RunServer(*server), 0);
+  EXPECT_EQ(loop.runs, 0);
+}
+
+TEST_F(ServerTest, RunServerRunsTheLoopAgainAfterEachSourceUntilStopped) {
+  create();
+  loop.whenRun = [&] {
+    if (loop.runs == 3) StopServer(*server);
+  };
+  EXPECT_EQ(RunServer(*server), static_cast<std::int32_t>(RunResult::stopped));
+  EXPECT_EQ(loop.runs, 3);
+  EXPECT_EQ(loop.stops, 1);
+}
+
+// ---- the idle rule ----
+
+TEST_F(ServerTest, NoClientEverConnectsAndTheProcessKeepsRunningWithoutATimer) {
+  create();
+  clock.advance(std::chrono::hours(24 * 365));
+  EXPECT_EQ(loop.stops, 0);
+  EXPECT_FALSE(server->stopFlag);
+  EXPECT_FALSE(idleTimerRuns());
+}
+
+TEST_F(ServerTest, LastClientGoesAwayWhileTheHostedServerIsBusyAndTheProcessStaysReaskingEvery10Seconds) {
+  create();
+  int asked = 0;
+  bool busy = true;
+  SetIdleCheck(server, [&] {
+    ++asked;
+    return busy;
+  });
+  ASSERT_EQ(checkIn(), kern::success);
+  clientDies(0);
+  clock.advance(9999ms);
+  EXPECT_EQ(asked, 0);
+  clock.advance(1ms);
+  EXPECT_EQ(asked, 1);
+  clock.advance(20s);
+  EXPECT_EQ(asked, 3);
+  EXPECT_FALSE(server->stopFlag);
+  busy = false;
+  clock.advance(10s);
+  EXPECT_EQ(asked, 4);
+  EXPECT_TRUE(server->stopFlag);
+}
+
+TEST_F(ServerTest, WithoutAHostedServerTheProcessStopsAtTheFirstTick10SecondsAfterTheLastClient) {
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  clock.advance(60s);
+  clientDies(0);
+  clock.advance(9999ms);
+  EXPECT_FALSE(server->stopFlag);
+  clock.advance(1ms);
+  EXPECT_TRUE(server->stopFlag);
+}
+
+TEST_F(ServerTest, WithoutAHostedServerTheProcessStopsAtTheFirstTick10SecondsAfterTheLastToken) {
+  create();
+  const auto token = AcquireBusyToken(*server);
+  clock.advance(60s);
+  EXPECT_EQ(ReleaseBusyToken(*server, token), 1U);
+  clock.advance(9999ms);
+  EXPECT_FALSE(server->stopFlag);
+  clock.advance(1ms);
+  EXPECT_TRUE(server->stopFlag);
+}
+
+TEST_F(ServerTest, ACheckInDuringTheIdlePeriodCancelsTheTimerAndTheCountdownRestartsFrom10Seconds) {
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  clientDies(0);
+  clock.advance(9s);
+  ASSERT_EQ(checkIn(), kern::success);
+  EXPECT_FALSE(idleTimerRuns());
+  clock.advance(60s);
+  clientDies(1);
+  clock.advance(9999ms);
+  EXPECT_FALSE(server->stopFlag);
+  clock.advance(1ms);
+  EXPECT_TRUE(server->stopFlag);
+}
+
+TEST_F(ServerTest, ANewBusyTokenDuringTheIdlePeriodCancelsTheTimerAndTheCountdownRestartsFrom10Seconds) {
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  clientDies(0);
+  clock.advance(9s);
+  const auto token = AcquireBusyToken(*server);
+  EXPECT_FALSE(idleTimerRuns());
+  clock.advance(60s);
+  ReleaseBusyToken(*server, token);
+  clock.advance(9999ms);
+  EXPECT_FALSE(server->stopFlag);
+  clock.advance(1ms);
+  EXPECT_TRUE(server->stopFlag);
+}
+
+TEST_F(ServerTest, AnIdleTimerThatCannotBeMadeStopsTheServerAtOnce) {
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  loop.refuseTimers = true;
+  clientDies(0);
+  EXPECT_TRUE(server->stopFlag);
+}
+
+TEST_F(ServerTest, ArmingTwiceKeepsTheFirstCountdown) {
+  create();
+  const auto token = AcquireBusyToken(*server);
+  ReleaseBusyToken(*server, token);
+  clock.advance(5s);
+  ReleaseBusyToken(*server, 0x4);  // well formed, though nobody holds it
+  EXPECT_TRUE(idleTimerRuns());
+  clock.advance(5s);
+  EXPECT_TRUE(server->stopFlag);
+}
+
+TEST_F(ServerTest, SetIdleCheckWithoutServerOrBlockDoesNothing) {
+  create();
+  SetIdleCheck(nullptr, [] { return true; });
+  SetIdleCheck(server, [] { return true; });
+  SetIdleCheck(server, {});
+  const auto token = AcquireBusyToken(*server);
+  ReleaseBusyToken(*server, token);
+  clock.advance(60s);
+  EXPECT_FALSE(server->stopFlag) << "the check that answers true is still in place";
+}
+
+// ---- busy tokens ----
+
+TEST_F(ServerTest, ReleaseBusyTokenWith0OrWith0x3Returns0AndLeavesTheMask) {
+  create();
+  AcquireBusyToken(*server);
+  AcquireBusyToken(*server);
+  EXPECT_EQ(ReleaseBusyToken(*server, 0), 0U);
+  EXPECT_EQ(ReleaseBusyToken(*server, 0x3), 0U);
+  EXPECT_EQ(server->busyMask, 0x3U);
+  EXPECT_FALSE(idleTimerRuns());
+}
+
+TEST_F(ServerTest, TokensAreTakenAboveTheRunOfHeldBitsFromBit0) {
+  create();
+  EXPECT_EQ(AcquireBusyToken(*server), 1U);
+  EXPECT_EQ(AcquireBusyToken(*server), 2U);
+  EXPECT_EQ(AcquireBusyToken(*server), 4U);
+  ReleaseBusyToken(*server, 2);
+  EXPECT_EQ(AcquireBusyToken(*server), 2U);
+  ReleaseBusyToken(*server, 1);
+  EXPECT_EQ(server->busyMask, 0x6U);
+  EXPECT_EQ(AcquireBusyToken(*server), 1U) << "a clear bit 0 below held bits is taken";
+}
+
+TEST_F(ServerTest, WithAll32TokensHeldTheNextOneIs1Again) {
+  create();
+  for (int i = 0; i < 32; ++i) AcquireBusyToken(*server);
+  EXPECT_EQ(server->busyMask, 0xFFFFFFFFU);
+  EXPECT_EQ(AcquireBusyToken(*server), 1U);
+}
+
+TEST_F(ServerTest, ReleasingATokenWhileOthersAreHeldDoesNotStartTheCountdown) {
+  create();
+  const auto first = AcquireBusyToken(*server);
+  const auto second = AcquireBusyToken(*server);
+  ReleaseBusyToken(*server, first);
+  EXPECT_FALSE(idleTimerRuns());
+  ReleaseBusyToken(*server, second);
+  EXPECT_TRUE(idleTimerRuns());
+}
+
+// ---- check-in ----
+
+TEST_F(ServerTest, AnEntitledCallerGetsAPortOfItsOwn) {
+  create();
+  EXPECT_EQ(checkIn(), kern::success);
+  EXPECT_EQ(askedEntitlement, "com.norvale.Teravox.BrenvikHelper.allow");
+  ASSERT_EQ(sources.routineSources.size(), 2U);
+  const auto& source = *sources.routineSources[1];
+  EXPECT_EQ(source.port, clientPort);
+  EXPECT_EQ(&source.table, &routines);
+  EXPECT_EQ(source.wantTrailer, WantTrailer::no);
+  EXPECT_TRUE(source.added);
+  EXPECT_EQ(ports.receiveRights.at(clientPort), 1);
+  EXPECT_EQ(ports.sendRights.at(clientPort), 1);
+  EXPECT_EQ(LookupServer(registry, clientPort), server);
+  EXPECT_EQ(LookupServer(registry, callerPort), server);
+}
+
+TEST_F(ServerTest, ACallerWithoutTheEntitlementGets35AndNoPortAndTheIdleStateIsUnchanged) {
+  create();
+  const auto token = AcquireBusyToken(*server);
+  ReleaseBusyToken(*server, token);
+  ASSERT_TRUE(idleTimerRuns());
+  clock.advance(5s);
+  entitled = false;
+  EXPECT_EQ(checkIn(), 35);
+  EXPECT_EQ(clientPort, kNullPort);
+  EXPECT_EQ(sources.routineSources.size(), 1U);
+  EXPECT_EQ(registry.size(), 1U);
+  clock.advance(5s);
+  EXPECT_TRUE(server->stopFlag) << "the countdown went on";
+}
+
+TEST_F(ServerTest, TwoCheckInsGiveTwoIndependentPortsEachTornDownWhenItsWatchedPortDies) {
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  const PortName first = clientPort;
+  ASSERT_EQ(checkIn(), kern::success);
+  const PortName second = clientPort;
+  EXPECT_NE(first, second);
+  clientDies(0);
+  EXPECT_EQ(LookupServer(registry, first), nullptr);
+  EXPECT_FALSE(sources.routineSources[1]->valid);
+  EXPECT_EQ(LookupServer(registry, second), server);
+  EXPECT_TRUE(sources.routineSources[2]->valid);
+  clientDies(1);
+  EXPECT_EQ(registry.size(), 1U) << "only the service port is left";
+  EXPECT_EQ(ports.receiveRights.size(), 1U);
+  EXPECT_TRUE(ports.sendRights.empty());
+}
+
+TEST_F(ServerTest, DeathOfAClientWhileABusyTokenIsHeldDoesNotArmTheTimerButItsReleaseDoes) {
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  const auto token = AcquireBusyToken(*server);
+  clientDies(0);
+  EXPECT_FALSE(idleTimerRuns());
+  ReleaseBusyToken(*server, token);
+  EXPECT_TRUE(idleTimerRuns());
+}
+
+TEST_F(ServerTest, TheSecondToLastClientGoingAwayDoesNotArmTheTimerTheLastOneDoes) {
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  ASSERT_EQ(checkIn(), kern::success);
+  clientDies(1);
+  EXPECT_FALSE(idleTimerRuns());
+  clientDies(0);
+  EXPECT_TRUE(idleTimerRuns());
+}
+
+TEST_F(ServerTest, AFailedPortCallPassesItsCodeThrough) {
+  create();
+  ports.refuseAllocate = kern::resourceShortage;
+  EXPECT_EQ(checkIn(), kern::resourceShortage);
+  ports.refuseAllocate = kern::success;
+  ports.refuseInsert = kern::noSpace;
+  EXPECT_EQ(checkIn(), kern::noSpace);
+  EXPECT_EQ(clientPort, kNullPort);
+  EXPECT_EQ(ports.receiveRights.size(), 1U);
+  EXPECT_EQ(registry.size(), 1U);
+}
+
+TEST_F(ServerTest, ASourceOrDeathWatchThatCannotBeMadeGives5AndLeavesNoState) {
+  create();
+  sources.refuseRoutineSources = true;
+  EXPECT_EQ(checkIn(), kern::failure);
+  sources.refuseRoutineSources = false;
+  sources.refuseDeathWatches = true;
+  EXPECT_EQ(checkIn(), kern::failure);
+  EXPECT_FALSE(sources.routineSources.back()->valid);
+  sources.refuseDeathWatches = false;
+  sources.refuseToBeAdded = true;
+  EXPECT_EQ(checkIn(), kern::failure);
+  EXPECT_EQ(clientPort, kNullPort);
+  EXPECT_EQ(ports.receiveRights.size(), 1U);
+  EXPECT_EQ(registry.size(), 1U);
+  EXPECT_TRUE(server->clientWatches.empty());
+}
+
+TEST_F(ServerTest, ACallerWhosePortIsAlreadyDeadGets5AndIsTornDownByTheCallback) {
+  create();
+  sources.portsAreDead = true;
+  EXPECT_EQ(checkIn(), kern::failure);
+  EXPECT_EQ(clientPort, kNullPort);
+  EXPECT_EQ(server->clientWatches.size(), 1U) << "the entries stay for the callback";
+  EXPECT_FALSE(idleTimerRuns());
+  clientDies(0);
+  EXPECT_TRUE(server->clientWatches.empty());
+  EXPECT_TRUE(server->clientSources.empty());
+  EXPECT_TRUE(idleTimerRuns());
+}
+
+TEST_F(ServerTest, ADeathWatchWithoutInfoIsFoundByItsPortName) {
+  create();
+  sources.dropInfo = true;
+  ASSERT_EQ(checkIn(), kern::success);
+  clientDies(0);
+  EXPECT_TRUE(server->clientWatches.empty());
+}
+
+TEST_F(ServerTest, ADeathThatBelongsToNoServerStopsTheProcessOnAnAssertion) {
+  create();
+  FakeDeathWatch stray(0x777, nullptr);
+  EXPECT_DEATH(
+      {
+        class StandardError final : public LogSink {
+          void unified(LogLevel, std::string_view line, const LogPlace&) noexcept override {
+            std::fprintf(stderr, "%.*s\n", static_cast<int>(line.size()), line.data());
+          }
+          void bsd(SyslogPriority, std::string_view) noexcept override {}
+        } sink;
+        setLogSink(&sink);
+        OnClientPortDied(stray, nullptr, registry);
+      },
+      "Assertion failed: \\(server\\), function MachPortInvalidationCallBack, file HelperServerUtils, line 317");
+}
+
+// ---- the check-in handler: form first, then the routine ----
+
+class CheckInHandlerTest : public ServerTest {
+ protected:
+  void SetUp() override {
+    create();
+    message.header.bits = kComplexBit | kReplyDisposition;
+    message.header.size = sizeof message;
+    message.header.replyPort = 7;
+    message.header.localPort = server->servicePort;
+    message.header.id = kCheckInRoutine.id;
+    message.descriptorCount = 1;
+    message.clientPort.name = ports.adoptSendRight();
+    message.clientPort.disposition = kDispositionMoveSend;
+    trailer.size = sizeof trailer;
+  }
+  // The code of a status reply, or 0 with `answer` holding the check-in reply.
+  KernelReturn deliver(std::uint32_t size = sizeof(CheckInRequest)) {
+    const auto& table = sources.routineSources.at(0)->table;
+    std::memset(&answer, 0, sizeof answer);
+    const Request request(reinterpret_cast<std::byte*>(&message), size, &trailer);
+    Reply reply(reinterpret_cast<std::byte*>(&answer));
+    const Outcome outcome = table.find(kCheckInRoutine.id)(table.context(), request, reply);
+    const auto& status = *reinterpret_cast<const StatusReply*>(&answer);
+    if ((answer.header.bits & kComplexBit) != 0) {
+      EXPECT_EQ(outcome, Outcome::accepted);
+      return kern::success;
+    }
+    EXPECT_EQ(outcome, Outcome::refused);
+    EXPECT_EQ(status.header.size, 36U);
+    EXPECT_EQ(std::memcmp(&status.ndr, &kNdrRecord, sizeof kNdrRecord), 0);
+    return status.returnCode;
+  }
+  struct {
+    CheckInRequest request;
+    std::byte more[8];
+  } padded{};
+  CheckInRequest& message = padded.request;
+  MessageTrailer trailer{};
+  CheckInReply answer{};
+};
+
+TEST_F(CheckInHandlerTest, AGoodCheckInIsAnsweredWithTheClientsPortAsACopySendRight) {
+  EXPECT_EQ(deliver(), kern::success);
+  EXPECT_EQ(answer.header.size, 40U);
+  EXPECT_EQ(answer.descriptorCount, 1U);
+  EXPECT_EQ(answer.servicePort.disposition, 19);
+  EXPECT_EQ(answer.servicePort.type, 0);
+  EXPECT_EQ(LookupServer(registry, answer.servicePort.name), server);
+}
+
+TEST_F(CheckInHandlerTest, SizeComplexFlagOrCountThatIsWrongGetsMinus304) {
+  EXPECT_EQ(deliver(39), -304);
+  EXPECT_EQ(deliver(41), -304);
+  message.descriptorCount = 2;
+  EXPECT_EQ(deliver(), -304);
+  message.descriptorCount = 1;
+  message.header.bits = kReplyDisposition;
+  EXPECT_EQ(deliver(), -304);
+}
+
+TEST_F(CheckInHandlerTest, ACheckInWhoseDescriptorCarriesACopySendInsteadOfAMoveSendGetsMinus300) {
+  message.clientPort.disposition = 19;
+  EXPECT_EQ(deliver(), -300);
+  message.clientPort.disposition = 17;
+  message.clientPort.type = 1;
+  EXPECT_EQ(deliver(), -300);
+}
+
+TEST_F(CheckInHandlerTest, ACheckInReceivedWithoutTheAuditTrailerGetsMinus309) {
+  trailer.size = kMinimalTrailerSize;
+  EXPECT_EQ(deliver(), -309);
+  trailer.size = 31;
+  EXPECT_EQ(deliver(), -309);
+  trailer.size = sizeof trailer;
+  trailer.type = 1;
+  EXPECT_EQ(deliver(), -309);
+}
+
+TEST_F(CheckInHandlerTest, FormIsCheckedBeforeTheDescriptorAndTheDescriptorBeforeTheTrailer) {
+  trailer.size = 8;
+  message.clientPort.disposition = 19;
+  EXPECT_EQ(deliver(41), -304);
+  EXPECT_EQ(deliver(), -300);
+}
+
+TEST_F(CheckInHandlerTest, ARefusedCallerGetsItsStatusAlone) {
+  entitled = false;
+  EXPECT_EQ(deliver(), 35);
+}
+
+}  // namespace
+}  // namespace brenvik

@@ -1,0 +1,145 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <deque>
+#include <map>
+#include <memory>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/ipc/Ports.h"
+
+namespace brenvik {
+
+// Ports without descriptors: names, references and refusals as a test asks for them. A right dropped once too
+// often is an error here as it is in the real space.
+class FakePortSpace final : public PortSpace {
+ public:
+  KernelReturn allocateReceiveRight(PortName* name) noexcept override {
+    if (refuseAllocate != kern::success) return refuseAllocate;
+    *name = next_++;
+    receiveRights[*name] = 1;
+    return kern::success;
+  }
+  KernelReturn insertSendRight(PortName name) noexcept override {
+    if (refuseInsert != kern::success) return refuseInsert;
+    if (receiveRights.count(name) == 0) return kern::invalidName;
+    ++sendRights[name];
+    return kern::success;
+  }
+  KernelReturn dropReceiveRight(PortName name) noexcept override { return drop(receiveRights, name); }
+  KernelReturn deallocateSendRight(PortName name) noexcept override { return drop(sendRights, name); }
+
+  // A right that arrived in a message.
+  PortName adoptSendRight() {
+    const PortName name = next_++;
+    sendRights[name] = 1;
+    return name;
+  }
+
+  std::map<PortName, int> receiveRights;
+  std::map<PortName, int> sendRights;
+  int failedDrops = 0;
+  KernelReturn refuseAllocate = kern::success;
+  KernelReturn refuseInsert = kern::success;
+
+ private:
+  KernelReturn drop(std::map<PortName, int>& rights, PortName name) {
+    const auto right = rights.find(name);
+    if (right == rights.end()) {
+      ++failedDrops;
+      return kern::invalidName;
+    }
+    if (--right->second == 0) rights.erase(right);
+    return kern::success;
+  }
+  PortName next_ = 0x103;
+};
+
+class FakeBootstrap final : public Bootstrap {
+ public:
+  explicit FakeBootstrap(FakePortSpace& ports) : ports_(ports) {}
+  KernelReturn checkIn(const char* serviceName, PortName* receiveRight) noexcept override {
+    name = serviceName;
+    if (refuseWith != kern::success) return refuseWith;
+    return ports_.allocateReceiveRight(receiveRight);
+  }
+  std::string name;
+  KernelReturn refuseWith = kern::success;
+
+ private:
+  FakePortSpace& ports_;
+};
+
+class FakeRoutineSource final : public RoutineSource {
+ public:
+  FakeRoutineSource(PortName servedPort, const RoutineTable& servedTable, WantTrailer trailer)
+      : port(servedPort), table(servedTable), wantTrailer(trailer) {}
+  bool addTo(RunLoop&) noexcept override { return added = !refuseToBeAdded; }
+  void invalidate() noexcept override { valid = false; }
+
+  const PortName port;
+  const RoutineTable& table;
+  const WantTrailer wantTrailer;
+  bool added = false;
+  bool valid = true;
+  bool refuseToBeAdded = false;
+};
+
+class FakeDeathWatch final : public DeathWatch {
+ public:
+  FakeDeathWatch(PortName port, void* info) : port_(port), info_(info) {}
+  PortName port() const noexcept override { return port_; }
+  bool isValid() const noexcept override { return valid_ && !died; }
+  void setInvalidationCallback(std::function<void(DeathWatch&)> callback) noexcept override {
+    callback_ = std::move(callback);
+  }
+  void invalidate() noexcept override { valid_ = false; }
+  void* info() const noexcept override { return info_; }
+
+  // The run loop notices that the port has died.
+  void tellDeath() {
+    died = true;
+    if (!valid_) return;
+    valid_ = false;
+    if (auto callback = std::exchange(callback_, {})) callback(*this);
+  }
+  bool died = false;
+
+ private:
+  const PortName port_;
+  void* const info_;
+  bool valid_ = true;
+  std::function<void(DeathWatch&)> callback_;
+};
+
+class FakePortSources final : public PortSources {
+ public:
+  std::shared_ptr<RoutineSource> makeRoutineSource(PortName port, const RoutineTable& table,
+                                                   WantTrailer trailer) noexcept override {
+    if (refuseRoutineSources) return nullptr;
+    auto source = std::make_shared<FakeRoutineSource>(port, table, trailer);
+    source->refuseToBeAdded = refuseToBeAdded;
+    routineSources.push_back(source);
+    return source;
+  }
+  std::shared_ptr<DeathWatch> makeDeathWatch(PortName port, RunLoop&, void* info) noexcept override {
+    if (refuseDeathWatches) return nullptr;
+    auto watch = std::make_shared<FakeDeathWatch>(port, dropInfo ? nullptr : info);
+    watch->died = portsAreDead;
+    deathWatches.push_back(watch);
+    return watch;
+  }
+
+  std::vector<std::shared_ptr<FakeRoutineSource>> routineSources;
+  std::vector<std::shared_ptr<FakeDeathWatch>> deathWatches;
+  bool refuseRoutineSources = false;
+  bool refuseToBeAdded = false;
+  bool refuseDeathWatches = false;
+  bool portsAreDead = false;
+  bool dropInfo = false;
+};
+
+}  // namespace brenvik
