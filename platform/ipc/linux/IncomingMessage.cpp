@@ -1,0 +1,130 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/ipc/linux/IncomingMessage.h"
+
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "platform/ipc/linux/DescriptorWalk.h"
+
+namespace brenvik {
+namespace {
+
+constexpr int kNeededSeals = F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE;
+
+bool isPortSocket(int fd) noexcept {
+  int domain = 0;
+  int type = 0;
+  socklen_t size = sizeof domain;
+  if (::getsockopt(fd, SOL_SOCKET, SO_DOMAIN, &domain, &size) != 0 || domain != AF_UNIX) return false;
+  size = sizeof type;
+  return ::getsockopt(fd, SOL_SOCKET, SO_TYPE, &type, &size) == 0 && type == SOCK_SEQPACKET;
+}
+
+}  // namespace
+
+IncomingMessage::~IncomingMessage() { release(false); }
+
+IncomingMessage::Received IncomingMessage::receive(int fd) noexcept {
+  release(false);
+  iovec io{storage_.bytes.data(), storage_.bytes.size()};
+  msghdr message{};
+  message.msg_iov = &io;
+  message.msg_iovlen = 1;
+  message.msg_control = storage_.control.data();
+  message.msg_controllen = storage_.control.size();
+  ssize_t size = 0;
+  do {
+    size = ::recvmsg(fd, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+  } while (size < 0 && errno == EINTR);
+  if (size < 0) return errno == EAGAIN || errno == EWOULDBLOCK ? Received::nothing : Received::endOfChannel;
+
+  sender_.reset();
+  for (cmsghdr* item = CMSG_FIRSTHDR(&message); item != nullptr; item = CMSG_NXTHDR(&message, item)) {
+    if (item->cmsg_level != SOL_SOCKET) continue;
+    if (item->cmsg_type == SCM_CREDENTIALS && item->cmsg_len >= CMSG_LEN(sizeof(ucred))) {
+      ucred credentials{};
+      std::memcpy(&credentials, CMSG_DATA(item), sizeof credentials);
+      sender_ = credentials;
+    } else if (item->cmsg_type == SCM_RIGHTS) {
+      const std::size_t count = (item->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+      for (std::size_t i = 0; i < count; ++i) {
+        int received = -1;
+        std::memcpy(&received, CMSG_DATA(item) + i * sizeof(int), sizeof received);
+        if (fdCount_ < fds_.size()) {
+          fds_[fdCount_++].reset(received);
+        } else {
+          ::close(received);
+        }
+      }
+    }
+  }
+  truncated_ = (message.msg_flags & (MSG_TRUNC | MSG_CTRUNC)) != 0;
+  length_ = static_cast<std::size_t>(size);
+  if (length_ == 0) {
+    release(false);
+    return Received::endOfChannel;
+  }
+  return Received::message;
+}
+
+bool IncomingMessage::mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept {
+  const int seals = ::fcntl(fd, F_GET_SEALS);
+  if (seals < 0 || (seals & kNeededSeals) != kNeededSeals) return false;
+  struct stat status{};
+  if (::fstat(fd, &status) != 0 || status.st_size < static_cast<off_t>(length)) return false;
+  void* const mapped = ::mmap(nullptr, length, PROT_READ, MAP_SHARED, fd, 0);
+  if (mapped == MAP_FAILED) return false;
+  mappings_[mappingCount_++] = {mapped, length};
+  *address = reinterpret_cast<std::uint64_t>(mapped);
+  return true;
+}
+
+bool IncomingMessage::unpack(PortName localPort) noexcept {
+  if (truncated_) return false;
+  const std::span<const std::byte> datagram(storage_.bytes.data(), length_);
+  const auto walk = walkDescriptors(datagram);
+  if (!walk || walk->rights != fdCount_) return false;
+
+  std::size_t nextFd = 0;
+  DescriptorCursor cursor(datagram, walk->messageSize);
+  while (const auto descriptor = cursor.next()) {
+    std::byte* const at = storage_.bytes.data() + descriptor->offset;
+    if (descriptor->kind == WalkedDescriptor::Kind::port) {
+      UniqueFd& fd = fds_[nextFd++];
+      if (!isPortSocket(fd.get())) return false;
+      const PortName name = ports_.adoptSendRight(std::move(fd));
+      if (name == kNullPort) return false;
+      names_[nameCount_++] = name;
+      std::memcpy(at + offsetof(PortDescriptor, name), &name, sizeof name);
+      continue;
+    }
+    std::uint64_t address = 0;  // an empty region stands nowhere, whatever the sender wrote
+    if (descriptor->kind == WalkedDescriptor::Kind::inLineRegion) {
+      address = reinterpret_cast<std::uint64_t>(storage_.bytes.data() + descriptor->regionOffset);
+    } else if (descriptor->kind == WalkedDescriptor::Kind::memfdRegion) {
+      if (!mapRegion(fds_[nextFd++].get(), descriptor->regionLength, &address)) return false;
+    }
+    std::memcpy(at + offsetof(OutOfLineDescriptor, address), &address, sizeof address);
+  }
+  auto& header = *reinterpret_cast<MessageHeader*>(storage_.bytes.data());
+  header.size = walk->messageSize;
+  header.localPort = localPort;
+  return true;
+}
+
+void IncomingMessage::release(bool keepRights) noexcept {
+  for (std::size_t i = 0; i < fdCount_; ++i) fds_[i].reset();
+  for (std::size_t i = 0; i < mappingCount_; ++i) ::munmap(mappings_[i].address, mappings_[i].length);
+  if (!keepRights) {
+    for (std::size_t i = 0; i < nameCount_; ++i) (void)ports_.deallocateSendRight(names_[i]);
+  }
+  fdCount_ = mappingCount_ = nameCount_ = length_ = 0;
+}
+
+}  // namespace brenvik

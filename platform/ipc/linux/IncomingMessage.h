@@ -1,0 +1,78 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <sys/socket.h>
+
+#include <array>
+#include <cstddef>
+#include <memory>
+#include <optional>
+
+#include "interface/Wire.h"
+#include "platform/base/UniqueFd.h"
+#include "platform/ipc/linux/SystemPortSpace.h"
+
+namespace brenvik {
+
+// One datagram at a time, with everything that came with it, in memory made once. Descriptors, mappings and
+// rights that nobody took over are released by release() or by the next receive(). Main loop only.
+class IncomingMessage {
+ public:
+  enum class Received { message, nothing, endOfChannel };
+
+  explicit IncomingMessage(SystemPortSpace& ports) noexcept : ports_(ports) {}
+  ~IncomingMessage();
+  IncomingMessage(const IncomingMessage&) = delete;
+  IncomingMessage& operator=(const IncomingMessage&) = delete;
+
+  // Takes the next datagram of a socket, without waiting: one system call.
+  Received receive(int fd) noexcept;
+
+  // Long enough to be looked at; a shorter datagram is dropped without an answer.
+  bool hasHeader() const noexcept { return length_ >= sizeof(MessageHeader); }
+
+  // Checks the framing, maps what travels as a memfd, gives names to the rights and writes both into the
+  // message, with its size and `localPort`. False when no correct sender makes such a datagram; the header is
+  // as sent then. Precondition: hasHeader().
+  bool unpack(PortName localPort) noexcept;
+
+  // The message, after unpack(); 8-byte aligned.
+  std::byte* bytes() noexcept { return storage_.bytes.data(); }
+  const MessageHeader& header() const noexcept {
+    return *reinterpret_cast<const MessageHeader*>(storage_.bytes.data());
+  }
+
+  // What the kernel says of the sender; nothing where the socket does not ask for it.
+  const std::optional<ucred>& sender() const noexcept { return sender_; }
+
+  // Ends the message: regions are unmapped; rights are kept when the routine took them over.
+  void release(bool keepRights) noexcept;
+
+ private:
+  static constexpr std::size_t kMostRights = 253;  // SCM_MAX_FD: what the kernel lets one message carry
+
+  struct Mapping {
+    void* address;
+    std::size_t length;
+  };
+  bool mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept;
+
+  SystemPortSpace& ports_;
+  std::size_t length_ = 0;
+  bool truncated_ = false;
+  std::optional<ucred> sender_;
+  std::size_t fdCount_ = 0;
+  std::size_t mappingCount_ = 0;
+  std::size_t nameCount_ = 0;
+  std::array<UniqueFd, kMostRights> fds_;
+  std::array<Mapping, kMostRights> mappings_;
+  std::array<PortName, kMostRights> names_;
+  struct Storage {
+    alignas(16) std::array<std::byte, kLargestDatagram> bytes;
+    alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * kMostRights) + CMSG_SPACE(sizeof(ucred))> control;
+  };
+  Storage storage_;
+};
+
+}  // namespace brenvik

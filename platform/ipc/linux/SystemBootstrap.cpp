@@ -1,0 +1,135 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/ipc/linux/SystemBootstrap.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <string_view>
+#include <thread>
+
+#include "platform/log/Log.h"
+
+namespace brenvik {
+namespace {
+
+// Two instances that start together settle who is first under a lock; the loser waits about as long as a start
+// takes, not for ever.
+constexpr int kLockTries = 100;
+constexpr std::chrono::milliseconds kLockPause{10};
+
+// Whether somebody listens behind a socket file.
+bool isAlive(const sockaddr_un& address) noexcept {
+  const UniqueFd probe(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  if (::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0) return true;
+  // EAGAIN: its backlog is full. EPROTOTYPE: another kind of socket, and a live one.
+  return errno == EAGAIN || errno == EPROTOTYPE;
+}
+
+bool lockWithin(int fd) noexcept {
+  for (int i = 0; i < kLockTries; ++i) {
+    if (::flock(fd, LOCK_EX | LOCK_NB) == 0) return true;
+    if (errno != EWOULDBLOCK && errno != EINTR) return false;
+    std::this_thread::sleep_for(kLockPause);
+  }
+  return false;
+}
+
+}  // namespace
+
+UniqueFd SystemBootstrap::fromServiceManager(const char* serviceName) noexcept {
+  char** names = nullptr;
+  const int count = sd_listen_fds_with_names(1, &names);
+  UniqueFd chosen;
+  for (int i = 0; i < count; ++i) {
+    UniqueFd given(SD_LISTEN_FDS_START + i);
+    const bool ours = names != nullptr && std::strcmp(names[i], serviceName) == 0;
+    if (!ours || chosen.isValid()) {
+      logUnified(LogLevel::error, "passed over a listening descriptor named \"%s\"", names != nullptr ? names[i] : "");
+    } else if (sd_is_socket_unix(given.get(), SOCK_SEQPACKET, 1, nullptr, 0) <= 0) {
+      logUnified(LogLevel::error, "the descriptor named \"%s\" is no listening SOCK_SEQPACKET socket", serviceName);
+    } else {
+      chosen = std::move(given);
+    }
+  }
+  if (names != nullptr) {
+    for (char** name = names; *name != nullptr; ++name) std::free(*name);
+    std::free(names);
+  }
+  return chosen;
+}
+
+UniqueFd SystemBootstrap::listenAt(const std::string& path, const char* serviceName) noexcept {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  if (path.size() >= sizeof address.sun_path) {
+    logUnified(LogLevel::error, "%s: the path is too long for a socket", path.c_str());
+    return {};
+  }
+  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+
+  std::error_code error;
+  std::filesystem::create_directories(directory_, error);
+  const std::string lockPath = directory_ + "/." + serviceName + ".lock";
+  const UniqueFd lock(::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600));
+  if (!lock.isValid() || !lockWithin(lock.get())) {
+    logUnified(LogLevel::error, "cannot lock %s: %s", lockPath.c_str(), std::strerror(errno));
+    return {};
+  }
+
+  struct stat status{};
+  if (::lstat(path.c_str(), &status) == 0) {
+    if (!S_ISSOCK(status.st_mode)) {
+      logUnified(LogLevel::error, "%s is not a socket, and stays as it is", path.c_str());
+      return {};
+    }
+    if (isAlive(address)) {
+      logUnified(LogLevel::error, "another process already serves %s", path.c_str());
+      return {};
+    }
+    ::unlink(path.c_str());
+  }
+
+  UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+  // Anybody may ask; who is refused is decided by entitlement.
+  if (!socket.isValid() || ::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
+      ::chmod(path.c_str(), 0666) != 0 || ::listen(socket.get(), SOMAXCONN) != 0) {
+    logUnified(LogLevel::error, "cannot listen at %s: %s", path.c_str(), std::strerror(errno));
+    return {};
+  }
+  return socket;
+}
+
+KernelReturn SystemBootstrap::checkIn(const char* serviceName, PortName* receiveRight) noexcept {
+  *receiveRight = kNullPort;
+  try {
+    std::string path;
+    UniqueFd socket = fromServiceManager(serviceName);
+    if (!socket.isValid()) {
+      path = directory_ + "/" + serviceName;
+      socket = listenAt(path, serviceName);
+    }
+    if (!socket.isValid()) return kern::noAccess;
+    // Before the first accept: a message that is already there would otherwise come without credentials.
+    const int on = 1;
+    if (::setsockopt(socket.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0) return kern::failure;
+    const int flags = ::fcntl(socket.get(), F_GETFL);
+    if (flags < 0 || ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK) != 0) return kern::failure;
+    *receiveRight = ports_.adoptService(std::move(socket), std::move(path));
+    return *receiveRight == kNullPort ? kern::resourceShortage : kern::success;
+  } catch (const std::bad_alloc&) {
+    return kern::resourceShortage;
+  }
+}
+
+}  // namespace brenvik

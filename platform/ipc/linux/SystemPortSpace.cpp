@@ -1,0 +1,152 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/ipc/linux/SystemPortSpace.h"
+
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <array>
+#include <new>
+
+namespace brenvik {
+
+// Names count up and wrap after four thousand million: a freed name is not met again soon.
+PortName SystemPortSpace::unusedName() noexcept {
+  do {
+    ++last_;
+  } while (!isUsablePort(last_) || ports_.count(last_) != 0);
+  return last_;
+}
+
+SystemPortSpace::Port* SystemPortSpace::insert(PortName* name) noexcept {
+  try {
+    const PortName fresh = unusedName();
+    Port& port = ports_[fresh];
+    *name = fresh;
+    return &port;
+  } catch (const std::bad_alloc&) {
+    *name = kNullPort;
+    return nullptr;
+  }
+}
+
+void SystemPortSpace::eraseIfUnused(PortName name) noexcept {
+  const auto found = ports_.find(name);
+  if (found == ports_.end()) return;
+  if (found->second.receiveReferences == 0 && found->second.sendReferences == 0) ports_.erase(found);
+}
+
+KernelReturn SystemPortSpace::allocateReceiveRight(PortName* name) noexcept {
+  *name = kNullPort;
+  std::array<int, 2> ends{-1, -1};
+  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()) != 0) return kern::resourceShortage;
+  UniqueFd receive(ends[0]);
+  UniqueFd peer(ends[1]);
+  try {
+    auto shared = std::make_shared<const UniqueFd>(std::move(receive));
+    Port* const port = insert(name);
+    if (port == nullptr) return kern::resourceShortage;
+    port->receive = std::move(shared);
+    port->receiveReferences = 1;
+    port->peer = std::move(peer);
+    return kern::success;
+  } catch (const std::bad_alloc&) {
+    return kern::resourceShortage;
+  }
+}
+
+KernelReturn SystemPortSpace::insertSendRight(PortName name) noexcept {
+  const auto found = ports_.find(name);
+  if (found == ports_.end()) return kern::invalidName;
+  Port& port = found->second;
+  if (port.receiveReferences == 0 || port.service) return kern::invalidRight;
+  if (port.send == nullptr) {
+    try {
+      port.send = std::make_shared<const UniqueFd>(std::move(port.peer));
+    } catch (const std::bad_alloc&) {
+      return kern::resourceShortage;
+    }
+  }
+  ++port.sendReferences;
+  return kern::success;
+}
+
+KernelReturn SystemPortSpace::dropReceiveRight(PortName name) noexcept {
+  const auto found = ports_.find(name);
+  if (found == ports_.end()) return kern::invalidName;
+  Port& port = found->second;
+  if (port.receiveReferences == 0) return kern::invalidRight;
+  if (--port.receiveReferences == 0) {
+    if (!port.socketFile.empty()) {
+      // Another instance may have put its own socket there since: only ours is removed.
+      struct stat status{};
+      if (::lstat(port.socketFile.c_str(), &status) == 0 && status.st_ino == port.socketInode) {
+        ::unlink(port.socketFile.c_str());
+      }
+    }
+    port.receive.reset();
+    port.peer.reset();
+  }
+  eraseIfUnused(name);
+  return kern::success;
+}
+
+KernelReturn SystemPortSpace::deallocateSendRight(PortName name) noexcept {
+  const auto found = ports_.find(name);
+  if (found == ports_.end()) return kern::invalidName;
+  Port& port = found->second;
+  if (port.sendReferences == 0) return kern::invalidRight;
+  if (--port.sendReferences == 0) port.send.reset();
+  eraseIfUnused(name);
+  return kern::success;
+}
+
+PortName SystemPortSpace::adoptService(UniqueFd listening, std::string socketFile) noexcept {
+  try {
+    auto shared = std::make_shared<const UniqueFd>(std::move(listening));
+    PortName name = kNullPort;
+    Port* const port = insert(&name);
+    if (port == nullptr) return kNullPort;
+    port->receive = std::move(shared);
+    port->receiveReferences = 1;
+    port->service = true;
+    struct stat status{};
+    if (!socketFile.empty() && ::lstat(socketFile.c_str(), &status) == 0) port->socketInode = status.st_ino;
+    port->socketFile = std::move(socketFile);
+    return name;
+  } catch (const std::bad_alloc&) {
+    return kNullPort;
+  }
+}
+
+PortName SystemPortSpace::adoptSendRight(UniqueFd end) noexcept {
+  try {
+    auto shared = std::make_shared<const UniqueFd>(std::move(end));
+    PortName name = kNullPort;
+    Port* const port = insert(&name);
+    if (port == nullptr) return kNullPort;
+    port->send = std::move(shared);
+    port->sendReferences = 1;
+    return name;
+  } catch (const std::bad_alloc&) {
+    return kNullPort;
+  }
+}
+
+SystemPortSpace::SharedFd SystemPortSpace::receiveEnd(PortName name) const noexcept {
+  const auto found = ports_.find(name);
+  return found == ports_.end() ? nullptr : found->second.receive;
+}
+
+SystemPortSpace::SharedFd SystemPortSpace::sendEnd(PortName name) const noexcept {
+  const auto found = ports_.find(name);
+  return found == ports_.end() ? nullptr : found->second.send;
+}
+
+bool SystemPortSpace::isService(PortName name) const noexcept {
+  const auto found = ports_.find(name);
+  return found != ports_.end() && found->second.service;
+}
+
+}  // namespace brenvik

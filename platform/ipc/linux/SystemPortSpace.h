@@ -1,0 +1,59 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <memory>
+#include <string>
+#include <unordered_map>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/ipc/Ports.h"
+
+namespace brenvik {
+
+// Ports on AF_UNIX SOCK_SEQPACKET sockets (unix(7)). A receive right is the end that is read: one end of a
+// socket pair, or a listening socket for a service. A send right is the other end. Main loop only.
+class SystemPortSpace final : public PortSpace {
+ public:
+  using SharedFd = std::shared_ptr<const UniqueFd>;
+
+  KernelReturn allocateReceiveRight(PortName* name) noexcept override;
+  KernelReturn insertSendRight(PortName name) noexcept override;
+  KernelReturn dropReceiveRight(PortName name) noexcept override;
+  KernelReturn deallocateSendRight(PortName name) noexcept override;
+
+  // Takes over a listening socket as the receive right of a service. `socketFile`: removed with the right, if
+  // it is still this socket's; empty: left alone. Null name when memory ran out.
+  PortName adoptService(UniqueFd listening, std::string socketFile) noexcept;
+  // Takes over a send right that arrived in a message. Null name when memory ran out.
+  PortName adoptSendRight(UniqueFd end) noexcept;
+
+  // The descriptor behind a right, kept open by the result even when the name is freed meanwhile; null when
+  // there is no such right.
+  SharedFd receiveEnd(PortName name) const noexcept;
+  SharedFd sendEnd(PortName name) const noexcept;
+  bool isService(PortName name) const noexcept;
+
+  std::size_t size() const noexcept { return ports_.size(); }
+
+ private:
+  struct Port {
+    SharedFd receive;  // with receiveReferences
+    UniqueFd peer;     // what send rights are made from
+    SharedFd send;     // with sendReferences
+    unsigned receiveReferences = 0;
+    unsigned sendReferences = 0;
+    bool service = false;
+    std::string socketFile;
+    unsigned long long socketInode = 0;
+  };
+
+  PortName unusedName() noexcept;
+  Port* insert(PortName* name) noexcept;
+  void eraseIfUnused(PortName name) noexcept;
+
+  std::unordered_map<PortName, Port> ports_;
+  PortName last_ = 0x100;
+};
+
+}  // namespace brenvik

@@ -1,0 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include <gtest/gtest.h>
+TEST(Placeholder, Builds) {}

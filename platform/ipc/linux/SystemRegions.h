@@ -1,0 +1,41 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstddef>
+#include <memory>
+#include <vector>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/ipc/RegionAllocator.h"
+
+namespace brenvik {
+
+// Regions for replies. One that fits a datagram beside its message is plain memory (the last one freed is kept
+// for the next); a larger one is written straight into a memfd (memfd_create(2)) that will travel as it is.
+class SystemRegions final : public RegionAllocator {
+ public:
+  // Longest region that travels in the same datagram as an out-of-line reply, in bytes.
+  static constexpr std::size_t kLongestInLine = kLargestDatagram - 56;
+
+  KernelReturn allocate(void** address, std::size_t length) noexcept override;
+  void deallocate(void* address, std::size_t length) noexcept override;
+
+  // For a region longer than kLongestInLine: takes its mapping away and returns its memfd, sealed against
+  // shrinking, growing and writing. An invalid descriptor when the kernel refused; the region is gone either way.
+  UniqueFd sealIntoDescriptor(void* address, std::size_t length) noexcept;
+
+  std::size_t live() const noexcept { return liveSmall_ + large_.size(); }
+
+ private:
+  struct Large {
+    void* address;
+    std::size_t length;
+    UniqueFd memfd;
+  };
+  std::unique_ptr<std::byte[]> spare_;
+  std::size_t liveSmall_ = 0;
+  std::vector<Large> large_;
+};
+
+}  // namespace brenvik
