@@ -1,0 +1,260 @@
+# SPDX-License-Identifier: Apache-2.0
+# SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+"""Starts the real daemon inside the sandbox and records both of its logs.
+
+Every test runs as root in a machine of its own (see the sandbox script): it may write entitlements, become
+another account and stop the daemon it started.
+"""
+import os
+import pathlib
+import plistlib
+import pwd
+import re
+import select
+import socket
+import struct
+import subprocess
+import sys
+import threading
+import time
+import unittest
+
+import wire
+
+BUILD = pathlib.Path(os.environ["BRENVIK_BUILD"])
+DAEMON = BUILD / "BrenvikMobileHelper"
+SOCKET = pathlib.Path(wire.BOOTSTRAP) / wire.SERVICE
+ENTITLEMENTS = pathlib.Path("/etc/brenvik/entitlements.d")
+ALLOW = "com.norvale.Teravox.BrenvikHelper.allow"
+ERROR, DEFAULT, INFO, DEBUG = 3, 5, 6, 7  # levels of the unified log
+LOG_ERR, LOG_NOTICE = 3, 5  # priorities of the BSD log
+
+
+def entitle(name="50-test.plist", executable=None, user="root", value=True, **more):
+    """Writes an entitlement file for an executable (default: this Python)."""
+    ENTITLEMENTS.mkdir(parents=True, exist_ok=True)
+    content = {"Executable": os.path.realpath(executable or sys.executable), "Entitlements": {ALLOW: value}, **more}
+    if user is not None:
+        content["User"] = user
+    path = ENTITLEMENTS / name
+    path.write_bytes(plistlib.dumps(content))
+    path.chmod(0o644)
+    return path
+
+
+class Logs:
+    """Stands where the journal and syslog stand and keeps each line as (channel, level, text)."""
+
+    JOURNAL = "/run/systemd/journal/socket"
+    SYSLOG = "/dev/log"
+
+    def __init__(self):
+        self.lines = []
+        self.entries = []  # of the journal, as dictionaries
+        self.changed = threading.Condition()
+        os.makedirs(os.path.dirname(self.JOURNAL), exist_ok=True)
+        self.sockets = {}
+        for channel, path in (("unified", self.JOURNAL), ("bsd", self.SYSLOG)):
+            if os.path.exists(path):
+                os.unlink(path)
+            sock = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
+            sock.bind(path)
+            os.chmod(path, 0o666)
+            self.sockets[sock] = channel
+        self.wake_read, self.wake_write = os.pipe()
+        self.thread = threading.Thread(target=self._read, daemon=True)
+        self.thread.start()
+
+    def _read(self):
+        while True:
+            ready, _, _ = select.select([*self.sockets, self.wake_read], [], [])
+            if self.wake_read in ready:
+                return
+            for sock in ready:
+                data = sock.recv(1 << 20)
+                with self.changed:
+                    if self.sockets[sock] == "unified":
+                        entry = self._journal(data)
+                        self.entries.append(entry)
+                        self.lines.append(("unified", int(entry["PRIORITY"]), entry["MESSAGE"]))
+                    else:
+                        priority, text = re.match(rb"<(\d+)>.{15} [^:]*: (.*)\Z", data, re.S).groups()
+                        self.lines.append(("bsd", int(priority) & 7, text.decode()))
+                    self.changed.notify_all()
+
+    @staticmethod
+    def _journal(data):
+        entry = {}
+        while data:
+            line, _, rest = data.partition(b"\n")
+            if b"=" in line:
+                key, _, value = line.partition(b"=")
+            else:
+                key = line
+                length, = struct.unpack_from("<Q", rest)
+                value, rest = rest[8:8 + length], rest[8 + length + 1:]
+            entry[key.decode()] = value.decode()
+            data = rest
+        return entry
+
+    def wait_for(self, channel, level, text, timeout=10):
+        """Waits until the very line has been logged; fails the test when it is not."""
+        with self.changed:
+            if not self.changed.wait_for(lambda: (channel, level, text) in self.lines, timeout):
+                raise AssertionError(f"no {channel}/{level} line {text!r} among {self.lines}")
+
+    def clear(self):
+        with self.changed:
+            self.lines.clear()
+            self.entries.clear()
+
+    def close(self):
+        os.write(self.wake_write, b"x")
+        self.thread.join()
+        os.close(self.wake_read)
+        os.close(self.wake_write)
+        for sock in self.sockets:
+            sock.close()
+        os.unlink(self.JOURNAL)
+        os.unlink(self.SYSLOG)
+
+
+class Daemon:
+    """The real daemon, standing alone or activated through a listening socket that the test holds."""
+
+    def __init__(self, activated=False, wait=True, arguments=(), environment=None, listening=None):
+        environment = {**os.environ, **(environment or {})}
+        self.listening = listening
+        command = [str(DAEMON), *arguments]
+        if activated:
+            if self.listening is None:
+                self.listening = listen()
+            descriptor = self.listening.fileno()
+            # LISTEN_PID must be the daemon's own, so a shell sets it and becomes the daemon.
+            command = ["/bin/sh", "-c", f'exec 3<&{descriptor}; LISTEN_PID=$$ exec "$@"', "sh", *command]
+            environment |= {"LISTEN_FDS": "1", "LISTEN_FDNAMES": wire.SERVICE}
+        self.process = subprocess.Popen(
+            command, env=environment, stderr=subprocess.PIPE, stdin=subprocess.DEVNULL,
+            pass_fds=[self.listening.fileno()] if activated else ())
+        self.stderr = b""
+        self.reader = threading.Thread(target=self._read_stderr, daemon=True)
+        self.reader.start()
+        if wait and not activated:
+            self.wait_until_listening()
+
+    def _read_stderr(self):
+        self.stderr = self.process.stderr.read()
+
+    @property
+    def pid(self):
+        return self.process.pid
+
+    def wait_until_listening(self, timeout=20):
+        end = time.monotonic() + timeout
+        while time.monotonic() < end:
+            if self.process.poll() is not None:
+                self.reader.join()
+                raise AssertionError(f"the daemon exited with {self.process.returncode}: {self.stderr.decode()}")
+            try:
+                wire.connect().close()
+                return
+            except (FileNotFoundError, ConnectionRefusedError):
+                time.sleep(0.01)
+        raise AssertionError("the daemon does not listen")
+
+    def wait(self, timeout=30):
+        """The exit status."""
+        status = self.process.wait(timeout)
+        self.reader.join()
+        return status
+
+    def stop(self):
+        if self.process.poll() is None:
+            self.process.terminate()
+        self.process.wait(20)
+        self.reader.join()
+        self.process.stderr.close()
+        if self.listening is not None:
+            self.listening.close()
+
+    def running(self):
+        return self.process.poll() is None
+
+    def descriptors(self):
+        return len(os.listdir(f"/proc/{self.pid}/fd"))
+
+    def threads(self):
+        return sorted(pathlib.Path(f"/proc/{self.pid}/task/{task}/comm").read_text().strip()
+                      for task in os.listdir(f"/proc/{self.pid}/task"))
+
+    def resident_kib(self):
+        return int(re.search(r"VmRSS:\s+(\d+)", pathlib.Path(f"/proc/{self.pid}/status").read_text())[1])
+
+    def maps(self):
+        return pathlib.Path(f"/proc/{self.pid}/maps").read_text()
+
+
+def listen(path=SOCKET):
+    """A listening socket as the service manager would make it."""
+    path = pathlib.Path(path)
+    path.parent.mkdir(parents=True, exist_ok=True)
+    if path.exists():
+        path.unlink()
+    sock = socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET)
+    sock.bind(str(path))
+    os.chmod(path, 0o666)
+    sock.listen(128)
+    return sock
+
+
+def as_account(name, work):
+    """Runs work() in a child process under another account; returns what it returns (a number 0..255)."""
+    pid = os.fork()
+    if pid == 0:
+        status = 255
+        try:
+            account = pwd.getpwnam(name)
+            os.setgroups([])
+            os.setresgid(account.pw_gid, account.pw_gid, account.pw_gid)
+            os.setresuid(account.pw_uid, account.pw_uid, account.pw_uid)
+            status = work()
+        except BaseException as error:  # the parent sees the number only
+            sys.stderr.write(f"as {name}: {error!r}\n")
+        finally:
+            os._exit(status)
+    return os.waitstatus_to_exitcode(os.waitpid(pid, 0)[1])
+
+
+def eventually(condition, timeout=10, what="the condition"):
+    """Waits until condition() is true."""
+    end = time.monotonic() + timeout
+    while not condition():
+        if time.monotonic() > end:
+            raise AssertionError(f"{what} did not come true in {timeout} s")
+        time.sleep(0.01)
+
+
+class HelperTest(unittest.TestCase):
+    """A running daemon for each test, with this Python entitled and both logs recorded."""
+
+    activated = False
+
+    def setUp(self):
+        self.logs = Logs()
+        self.addCleanup(self.logs.close)
+        entitle()
+        self.prepare()
+        self.daemon = Daemon(activated=self.activated)
+        self.addCleanup(self.daemon.stop)
+
+    def prepare(self):
+        """For what must be in place before the daemon starts."""
+
+    def client(self):
+        client = wire.Client()
+        self.addCleanup(client.close)
+        return client
+
+
+def main():
+    unittest.main(verbosity=2)
