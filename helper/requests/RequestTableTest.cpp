@@ -3,4 +3,436 @@
 #include "helper/requests/RequestTable.h"
 
 #include <gtest/gtest.h>
-TEST(Placeholder, Builds) {}
+
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "interface/Routines.h"
+
+namespace brenvik {
+namespace {
+
+// Writes down each call, returns what the test wants and answers with recognisable results.
+class RecordingRoutines final : public ServerRoutines {
+ public:
+  std::string called;
+  PortName port = kNullPort;
+  std::vector<std::string> texts;
+  std::int32_t integer = 0;
+  double latitude = 0;
+  double longitude = 0;
+  std::string firstRegion;
+  std::string secondRegion;
+  KernelReturn answer = kern::success;
+
+  KernelReturn server_BVMobileHelperSetVoicemailToken(PortName p, char* token) override {
+    return note("SetVoicemailToken", p, {text(token, 256)});
+  }
+  KernelReturn server_BVMobileHelperSetVoicemailTokenForKey(PortName p, char* key, char* token) override {
+    return note("SetVoicemailTokenForKey", p, {text(key, 256), text(token, 256)});
+  }
+  KernelReturn server_BVMobileHelperClearVoicemailToken(PortName p) override {
+    return note("ClearVoicemailToken", p, {});
+  }
+  KernelReturn server_BVMobileHelperResetVoicemailStore(PortName p) override {
+    return note("ResetVoicemailStore", p, {});
+  }
+  KernelReturn server_BVMobileHelperCopyVoicemailTokenForKey(PortName p, char* key, char* token) override {
+    std::strcpy(token, "a token");
+    return note("CopyVoicemailTokenForKey", p, {text(key, 256)});
+  }
+  KernelReturn server_BVMobileHelperCopyVoicemailToken(PortName p, char* token) override {
+    std::memset(token, 'x', 256);
+    return note("CopyVoicemailToken", p, {});
+  }
+  KernelReturn server_BVMobileHelperSetPreferenceValue(PortName p, char* domain, char* key, const void* value,
+                                                       std::uint32_t length) override {
+    firstRegion.assign(static_cast<const char*>(value), length);
+    return note("SetPreferenceValue", p, {text(domain, 256), text(key, 256)});
+  }
+  KernelReturn server_BVMobileHelperCopyPreferenceValue(PortName p, char* domain, char* key,
+                                                        OutOfLinePayload* value) override {
+    *value = payload;
+    return note("CopyPreferenceValue", p, {text(domain, 256), text(key, 256)});
+  }
+  KernelReturn server_BVMobileHelperCopyAppPreferenceValue(PortName p, char* domain, char* key,
+                                                           OutOfLinePayload* value) override {
+    *value = payload;
+    return note("CopyAppPreferenceValue", p, {text(domain, 256), text(key, 256)});
+  }
+  KernelReturn server_BVMobileHelperReplaceCarrierSymlink(PortName p, char* target, char* link,
+                                                          char* domain) override {
+    return note("ReplaceCarrierSymlink", p, {text(target, 1024), text(link, 1024), text(domain, 1024)});
+  }
+  KernelReturn server_BVMobileHelperCreateSymlink(PortName p, char* target, char* link) override {
+    return note("CreateSymlink", p, {text(target, 1024), text(link, 1024)});
+  }
+  KernelReturn server_BVMobileHelperRemoveCarrierFile(PortName p, char* path, char* domain) override {
+    return note("RemoveCarrierFile", p, {text(path, 1024), text(domain, 1024)});
+  }
+  KernelReturn server_BVMobileHelperIsVoicemailServiceSubscribed(PortName p, std::uint8_t* subscribed) override {
+    *subscribed = 1;
+    return note("IsVoicemailServiceSubscribed", p, {});
+  }
+  KernelReturn server_BVMobileHelperCellularHeartbeat(PortName p, std::int32_t value) override {
+    integer = value;
+    return note("CellularHeartbeat", p, {});
+  }
+  KernelReturn server_BVMobileHelperCheckLASDUpdate(PortName p, std::int32_t mask) override {
+    integer = mask;
+    return note("CheckLASDUpdate", p, {});
+  }
+  KernelReturn server_BVMobileHelperCopyCarrierFile(PortName p, char* source, char* destination, char* name,
+                                                    std::uint8_t* success) override {
+    *success = 1;
+    return note("CopyCarrierFile", p, {text(source, 256), text(destination, 256), text(name, 256)});
+  }
+  KernelReturn server_BVMobileHelperCopyCrashLogs(PortName p, char* path, std::uint8_t* success) override {
+    *success = 1;
+    return note("CopyCrashLogs", p, {text(path, 256)});
+  }
+  KernelReturn server_BVMobileHelperMoveIntoCarrierBundles(PortName p, char* source, char* destination, char* name,
+                                                           std::uint8_t* success) override {
+    *success = 1;
+    return note("MoveIntoCarrierBundles", p, {text(source, 256), text(destination, 256), text(name, 256)});
+  }
+  KernelReturn server_BVMobileHelperRequestCountryCodeFromLocation(PortName p, double lat, double lon) override {
+    latitude = lat;
+    longitude = lon;
+    return note("RequestCountryCodeFromLocation", p, {});
+  }
+  KernelReturn server_BVMobileHelperCopyCountryCode(PortName p, char* code) override {
+    std::strcpy(code, "NO");
+    return note("CopyCountryCode", p, {});
+  }
+  KernelReturn server_BVMobileHelperRequestWanIPFromLocation(PortName p) override {
+    return note("RequestWanIPFromLocation", p, {});
+  }
+  KernelReturn server_BVMobileHelperEnableRadioManagerLogs(PortName p, std::int32_t enable) override {
+    integer = enable;
+    return note("EnableRadioManagerLogs", p, {});
+  }
+  KernelReturn server_BVMobileHelperUnpackArchive(PortName p, char* archive, char* destination,
+                                                  std::uint8_t* success) override {
+    *success = 1;
+    return note("UnpackArchive", p, {text(archive, 256), text(destination, 256)});
+  }
+  KernelReturn server_BVMobileHelperLoadPlistFile(PortName p, char* path, OutOfLinePayload* contents) override {
+    *contents = payload;
+    return note("LoadPlistFile", p, {text(path, 256)});
+  }
+  KernelReturn server_BVMobileHelperCopyBadgeLabels(PortName p, const void* labels, std::uint32_t labelsLength,
+                                                    const void* languages, std::uint32_t languagesLength,
+                                                    OutOfLinePayload* badges) override {
+    firstRegion.assign(static_cast<const char*>(labels), labelsLength);
+    secondRegion.assign(static_cast<const char*>(languages), languagesLength);
+    *badges = payload;
+    return note("CopyBadgeLabels", p, {});
+  }
+  KernelReturn server_BVMobileHelperCopyLocalizedLabels(PortName p, const void* labels, std::uint32_t labelsLength,
+                                                        const void* languages, std::uint32_t languagesLength,
+                                                        OutOfLinePayload* localized) override {
+    firstRegion.assign(static_cast<const char*>(labels), labelsLength);
+    secondRegion.assign(static_cast<const char*>(languages), languagesLength);
+    *localized = payload;
+    return note("CopyLocalizedLabels", p, {});
+  }
+  KernelReturn server_BVMobileHelperRemapContactsChannel(PortName p, char* from, char* to,
+                                                         std::uint8_t* success) override {
+    *success = 1;
+    return note("RemapContactsChannel", p, {text(from, 64), text(to, 64)});
+  }
+
+  char region[5] = {'b', 'y', 't', 'e', 's'};
+  OutOfLinePayload payload{region, sizeof region};
+
+ private:
+  // The whole field: the handlers pass it on as it is, terminated or not.
+  static std::string text(const char* field, std::size_t size) { return {field, ::strnlen(field, size)}; }
+  KernelReturn note(const char* name, PortName p, std::vector<std::string> arguments) {
+    called = name;
+    port = p;
+    texts = std::move(arguments);
+    return answer;
+  }
+};
+
+constexpr PortName kPort = 0x903;
+
+class RequestTableTest : public testing::Test {
+ protected:
+  // A request of the row's own form, with each string field filled with its own letter to the last byte.
+  void makeRequest(const RoutineFacts& facts) {
+    std::memset(message, 0, sizeof message);
+    auto& header = *reinterpret_cast<MessageHeader*>(message);
+    header.bits = kReplyDisposition;
+    header.size = facts.requestSize;
+    header.replyPort = 5;
+    header.localPort = kPort;
+    header.id = facts.id;
+    if (facts.descriptors == 0) {
+      for (std::size_t i = 32; i < facts.requestSize; ++i) message[i] = static_cast<std::byte>('a');
+      return;
+    }
+    header.bits |= kComplexBit;
+    write(kDescriptorCountOffset, facts.descriptors);
+    for (std::uint32_t i = 0; i < facts.descriptors; ++i) {
+      auto& region = descriptor(i);
+      region.address = reinterpret_cast<std::uint64_t>(i == 0 ? "first" : "other");
+      region.type = kOutOfLineDescriptorType;
+      region.size = 5;
+      write(facts.lengthsOffset + i * 4, 5);
+    }
+  }
+  void write(std::size_t offset, std::uint32_t value) { std::memcpy(message + offset, &value, sizeof value); }
+  OutOfLineDescriptor& descriptor(std::uint32_t i) {
+    return *reinterpret_cast<OutOfLineDescriptor*>(message + kDescriptorsOffset + i * sizeof(OutOfLineDescriptor));
+  }
+
+  // Delivers `size` bytes; the status reply's code, or 0 for a reply of another form.
+  KernelReturn deliver(std::int32_t id, std::uint32_t size) {
+    std::memset(answer, 0, sizeof answer);
+    const MessageTrailer trailer{};
+    const Request request(message, size, &trailer);
+    Reply reply(answer);
+    const auto handler = table.find(id);
+    EXPECT_NE(handler, nullptr);
+    outcome = handler(table.context(), request, reply);
+    const auto& status = *reinterpret_cast<const StatusReply*>(answer);
+    return (status.header.bits & kComplexBit) != 0 ? kern::success : status.returnCode;
+  }
+  KernelReturn deliver(const RoutineFacts& facts) { return deliver(facts.id, facts.requestSize); }
+  void expectRefusedWith(const RoutineFacts& facts, std::uint32_t size, KernelReturn code) {
+    routines.called.clear();
+    EXPECT_EQ(deliver(facts.id, size), code) << facts.name << " of " << size << " bytes";
+    EXPECT_EQ(routines.called, "") << facts.name;
+    EXPECT_EQ(outcome, Outcome::refused);
+    const auto& status = *reinterpret_cast<const StatusReply*>(answer);
+    EXPECT_EQ(status.header.size, 36U);
+    EXPECT_EQ(status.header.bits, kReplyDisposition);
+    EXPECT_EQ(std::memcmp(&status.ndr, &kNdrRecord, sizeof kNdrRecord), 0);
+  }
+
+  RecordingRoutines routines;
+  RequestTable table{routines};
+  Outcome outcome = Outcome::refused;
+  alignas(16) std::byte message[4096];
+  alignas(16) std::byte answer[512];
+};
+
+TEST_F(RequestTableTest, EveryRowReachesItsOwnRoutineWithThePortItArrivedOn) {
+  for (const auto& facts : kRequestRoutines) {
+    makeRequest(facts);
+    EXPECT_EQ(deliver(facts), kern::success) << facts.name;
+    EXPECT_EQ("BVMobileHelper" + routines.called, facts.name);
+    EXPECT_EQ(routines.port, kPort);
+    EXPECT_EQ(outcome, Outcome::accepted);
+  }
+}
+
+TEST_F(RequestTableTest, IdsOutsideTheRangeHaveNoHandler) {
+  EXPECT_EQ(table.find(8683548), nullptr);
+  EXPECT_EQ(table.find(8683576), nullptr);
+  EXPECT_EQ(table.find(4792174), nullptr) << "a check-in sent to a client port is an unknown id";
+  EXPECT_EQ(table.find(0), nullptr);
+  EXPECT_EQ(table.find(-1), nullptr);
+  EXPECT_EQ(table.find(INT32_MIN), nullptr);
+}
+
+TEST_F(RequestTableTest, ARequestOneByteLongerOrShorterThanItsRowGetsMinus304AndHasNoEffect) {
+  for (const auto& facts : kRequestRoutines) {
+    makeRequest(facts);
+    expectRefusedWith(facts, facts.requestSize - 1, mig::badArguments);
+    expectRefusedWith(facts, facts.requestSize + 1, mig::badArguments);
+  }
+}
+
+TEST_F(RequestTableTest, TheComplexFlagMustBeClearInASimpleRequestAndSetInAComplexOne) {
+  for (const auto& facts : kRequestRoutines) {
+    makeRequest(facts);
+    reinterpret_cast<MessageHeader*>(message)->bits ^= kComplexBit;
+    expectRefusedWith(facts, facts.requestSize, mig::badArguments);
+  }
+}
+
+TEST_F(RequestTableTest, ADescriptorCountOtherThanTheRowsGetsMinus304) {
+  for (const auto& facts : kRequestRoutines) {
+    if (facts.descriptors == 0) continue;
+    for (const std::uint32_t count : {0U, facts.descriptors - 1, facts.descriptors + 1, ~0U}) {
+      makeRequest(facts);
+      write(kDescriptorCountOffset, count);
+      expectRefusedWith(facts, facts.requestSize, mig::badArguments);
+    }
+  }
+}
+
+TEST_F(RequestTableTest, LabelsSentWithOneDescriptorInsteadOfTwoGetMinus304) {
+  makeRequest(kRequestRoutines[24]);
+  write(kDescriptorCountOffset, 1);
+  expectRefusedWith(kRequestRoutines[24], 76, -304);
+}
+
+TEST_F(RequestTableTest, APreferenceWhoseLengthFieldDiffersFromTheDescriptorsSizeGetsMinus300) {
+  makeRequest(kRequestRoutines[6]);
+  write(564, 4);
+  expectRefusedWith(kRequestRoutines[6], 568, -300);
+}
+
+TEST_F(RequestTableTest, EveryDescriptorMustBeOutOfLineAndAgreeWithItsLengthField) {
+  for (const auto& facts : kRequestRoutines) {
+    for (std::uint32_t i = 0; i < facts.descriptors; ++i) {
+      makeRequest(facts);
+      descriptor(i).type = 2;
+      expectRefusedWith(facts, facts.requestSize, mig::typeError);
+      makeRequest(facts);
+      descriptor(i).size = 6;
+      expectRefusedWith(facts, facts.requestSize, mig::typeError);
+    }
+  }
+}
+
+TEST_F(RequestTableTest, ARoutinesOwnStatusIsPassedOnInAStatusReplyWhateverTheRowsForm) {
+  routines.answer = 8;
+  for (const auto& facts : kRequestRoutines) {
+    makeRequest(facts);
+    EXPECT_EQ(deliver(facts), 8) << facts.name;
+    EXPECT_EQ(outcome, Outcome::refused);
+    const auto& status = *reinterpret_cast<const StatusReply*>(answer);
+    EXPECT_EQ(status.header.size, 36U);
+    EXPECT_EQ(std::memcmp(&status.ndr, &kNdrRecord, sizeof kNdrRecord), 0) << facts.name;
+  }
+}
+
+TEST_F(RequestTableTest, RepliesHaveTheFormOfTheirRow) {
+  for (const auto& facts : kRequestRoutines) {
+    makeRequest(facts);
+    ASSERT_EQ(deliver(facts), kern::success);
+    const auto& status = *reinterpret_cast<const StatusReply*>(answer);
+    EXPECT_EQ(status.header.size, sizeOfReply(facts.reply)) << facts.name;
+    if (facts.reply == ReplyForm::outOfLine) {
+      const auto& reply = *reinterpret_cast<const OutOfLineReply*>(answer);
+      EXPECT_EQ(reply.header.bits, kComplexBit | kReplyDisposition);
+      EXPECT_EQ(reply.descriptorCount, 1U);
+      EXPECT_EQ(reply.payload.address, reinterpret_cast<std::uint64_t>(routines.region));
+      EXPECT_EQ(reply.payload.deallocate, 1);
+      EXPECT_EQ(reply.payload.copy, 1);
+      EXPECT_EQ(reply.payload.pad, 0);
+      EXPECT_EQ(reply.payload.type, 1);
+      EXPECT_EQ(reply.payload.size, 5U);
+      EXPECT_EQ(reply.byteCount, 5U);
+      EXPECT_EQ(std::memcmp(&reply.ndr, &kNdrRecord, sizeof kNdrRecord), 0);
+    } else {
+      EXPECT_EQ(status.header.bits, kReplyDisposition);
+    }
+    if (facts.reply == ReplyForm::integer) {
+      const auto& reply = *reinterpret_cast<const IntegerReply*>(answer);
+      EXPECT_EQ(reply.result[0], 1) << facts.name;
+      EXPECT_EQ(reply.result[1] | reply.result[2] | reply.result[3], 0) << facts.name;
+    }
+  }
+}
+
+TEST_F(RequestTableTest, TheUpdateChecksReplyLeavesTheNdrRecordToTheSourceOnSuccessOnly) {
+  const auto& facts = kRequestRoutines[14];
+  ASSERT_EQ(facts.id, 8683563);
+  makeRequest(facts);
+  ASSERT_EQ(deliver(facts), kern::success);
+  const NdrRecord untouched{};
+  EXPECT_EQ(std::memcmp(answer + 24, &untouched, sizeof untouched), 0);
+  expectRefusedWith(facts, facts.requestSize + 1, mig::badArguments);  // asserts the NDR record
+  for (const auto& other : kRequestRoutines) {
+    if (other.id == facts.id) continue;
+    makeRequest(other);
+    ASSERT_EQ(deliver(other), kern::success);
+    const std::size_t at = other.reply == ReplyForm::outOfLine ? 44 : 24;
+    EXPECT_EQ(std::memcmp(answer + at, &kNdrRecord, sizeof kNdrRecord), 0) << other.name;
+  }
+}
+
+TEST_F(RequestTableTest, ArgumentsArriveFromTheirOffsets) {
+  const auto fill = [&](std::size_t offset, std::size_t size, char letter) {
+    std::memset(message + offset, letter, size);
+  };
+  makeRequest(kRequestRoutines[9]);
+  fill(32, 1024, 't');
+  fill(1056, 1024, 'l');
+  fill(2080, 1024, 'd');
+  deliver(kRequestRoutines[9]);
+  EXPECT_EQ(routines.texts,
+            (std::vector{std::string(1024, 't'), std::string(1024, 'l'), std::string(1024, 'd')}));
+
+  makeRequest(kRequestRoutines[15]);
+  fill(32, 256, 's');
+  fill(288, 256, 'd');
+  fill(544, 256, 'n');
+  deliver(kRequestRoutines[15]);
+  EXPECT_EQ(routines.texts, (std::vector{std::string(256, 's'), std::string(256, 'd'), std::string(256, 'n')}));
+
+  makeRequest(kRequestRoutines[26]);
+  fill(32, 64, 'f');
+  fill(96, 64, 't');
+  deliver(kRequestRoutines[26]);
+  EXPECT_EQ(routines.texts, (std::vector{std::string(64, 'f'), std::string(64, 't')}));
+
+  makeRequest(kRequestRoutines[6]);
+  fill(52, 256, 'd');
+  fill(308, 256, 'k');
+  deliver(kRequestRoutines[6]);
+  EXPECT_EQ(routines.texts, (std::vector{std::string(256, 'd'), std::string(256, 'k')}));
+  EXPECT_EQ(routines.firstRegion, "first");
+
+  makeRequest(kRequestRoutines[25]);
+  deliver(kRequestRoutines[25]);
+  EXPECT_EQ(routines.firstRegion, "first");
+  EXPECT_EQ(routines.secondRegion, "other");
+
+  makeRequest(kRequestRoutines[18]);
+  const double latitude = 59.91;
+  const double longitude = -10.75;
+  std::memcpy(message + 32, &latitude, 8);
+  std::memcpy(message + 40, &longitude, 8);
+  deliver(kRequestRoutines[18]);
+  EXPECT_EQ(routines.latitude, latitude);
+  EXPECT_EQ(routines.longitude, longitude);
+
+  for (const std::size_t row : {13U, 14U, 21U}) {
+    makeRequest(kRequestRoutines[row]);
+    write(32, 0xFFFFFFFE);
+    deliver(kRequestRoutines[row]);
+    EXPECT_EQ(routines.integer, -2);
+  }
+}
+
+TEST_F(RequestTableTest, TextResultsAreWrittenStraightIntoTheReply) {
+  makeRequest(kRequestRoutines[4]);
+  deliver(kRequestRoutines[4]);
+  EXPECT_EQ(std::string(reinterpret_cast<const char*>(answer) + 36), "a token");
+  makeRequest(kRequestRoutines[5]);
+  deliver(kRequestRoutines[5]);
+  EXPECT_EQ(std::string(reinterpret_cast<const char*>(answer) + 36, 256), std::string(256, 'x'));
+  makeRequest(kRequestRoutines[19]);
+  deliver(kRequestRoutines[19]);
+  EXPECT_EQ(std::string(reinterpret_cast<const char*>(answer) + 36, 64), "NO" + std::string(62, '\0'));
+}
+
+TEST_F(RequestTableTest, AnEmptyPayloadIsSuccessWithAddressAndLengthZero) {
+  routines.payload = {};
+  makeRequest(kRequestRoutines[7]);
+  ASSERT_EQ(deliver(kRequestRoutines[7]), kern::success);
+  const auto& reply = *reinterpret_cast<const OutOfLineReply*>(answer);
+  EXPECT_EQ(reply.header.size, 56U);
+  EXPECT_EQ(reply.payload.address, 0U);
+  EXPECT_EQ(reply.payload.size, 0U);
+  EXPECT_EQ(reply.byteCount, 0U);
+}
+
+TEST_F(RequestTableTest, APayloadThatAFailedRoutineLeftBehindIsNotSent) {
+  routines.answer = kern::noSpace;
+  makeRequest(kRequestRoutines[23]);
+  EXPECT_EQ(deliver(kRequestRoutines[23]), kern::noSpace);
+  for (std::size_t i = 36; i < sizeof answer; ++i) EXPECT_EQ(answer[i], std::byte{0});
+}
+
+}  // namespace
+}  // namespace brenvik
