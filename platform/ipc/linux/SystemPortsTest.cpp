@@ -1,4 +1,891 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include <dirent.h>
+#include <fcntl.h>
 #include <gtest/gtest.h>
-TEST(Placeholder, Builds) {}
+#include <poll.h>
+#include <sys/mman.h>
+#include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <array>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <string>
+#include <vector>
+
+#include "platform/ipc/linux/MessageTrailerBuilder.h"
+#include "platform/ipc/linux/SystemBootstrap.h"
+#include "platform/ipc/linux/SystemPortSources.h"
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/runloop/linux/SystemQueues.h"
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+
+std::size_t openDescriptors() {
+  std::size_t count = 0;
+  DIR* const directory = ::opendir("/proc/self/fd");
+  while (::readdir(directory) != nullptr) ++count;
+  ::closedir(directory);
+  return count;
+}
+
+// A datagram under construction, and what goes with it.
+struct Datagram {
+  std::vector<std::byte> bytes;
+  std::vector<int> fds;
+
+  template <class Value>
+  Datagram& add(const Value& value) {
+    const auto* const raw = reinterpret_cast<const std::byte*>(&value);
+    bytes.insert(bytes.end(), raw, raw + sizeof value);
+    return *this;
+  }
+  Datagram& text(std::string_view text) {
+    const auto* const raw = reinterpret_cast<const std::byte*>(text.data());
+    bytes.insert(bytes.end(), raw, raw + text.size());
+    return *this;
+  }
+  Datagram& padTo(std::size_t size) {
+    bytes.resize(size);
+    return *this;
+  }
+};
+
+constexpr std::int32_t kEcho = 100;       // complex or not; the reply is a status of the regions' bytes summed up
+constexpr std::int32_t kRegion = 101;     // replies with a region of as many bytes as the request's u32 at 32 says
+constexpr std::int32_t kKeepRight = 102;  // takes the right over; status 0
+constexpr std::int32_t kRefuse = 103;     // refuses with 5
+constexpr std::int32_t kThrow = 104;      // memory runs out in the routine
+constexpr std::int32_t kGiveRight = 105;  // a check-in reply with the right that `given` names
+
+Datagram message(std::int32_t id, std::uint32_t bits = kReplyDisposition, std::uint32_t size = 24,
+                 PortName replyPort = 77) {
+  return Datagram().add(MessageHeader{bits, size, replyPort, 0, 0, id});
+}
+Datagram complexMessage(std::int32_t id, std::uint32_t count, std::uint32_t size) {
+  return message(id, kComplexBit | kReplyDisposition, size).add(count);
+}
+OutOfLineDescriptor region(std::uint64_t address, std::uint32_t size) {
+  return {address, 0, 1, 0, kOutOfLineDescriptorType, size};
+}
+PortDescriptor right() { return {0, 0, 0, kDispositionMoveSend, kPortDescriptorType}; }
+
+class TestTable final : public RoutineTable {
+ public:
+  explicit TestTable(SystemRegions& regions) : regions_(regions) {}
+  Handler find(std::int32_t id) const noexcept override { return id >= kEcho && id <= kGiveRight ? &handle : nullptr; }
+  void* context() const noexcept override { return const_cast<TestTable*>(this); }
+
+  int served = 0;
+  std::vector<PortName> names;
+  std::vector<std::uint32_t> sizes;
+  MessageTrailer trailer{};
+  PortName arrivedOn = 0;
+  PortName given = 0;
+  std::function<void()> whileServing;
+
+ private:
+  static Outcome handle(void* context, const Request& request, Reply& reply) {
+    auto& self = *static_cast<TestTable*>(context);
+    ++self.served;
+    self.arrivedOn = request.localPort();
+    self.sizes.push_back(request.size());
+    self.trailer = MessageTrailer{};
+    std::memcpy(&self.trailer, &request.trailer(), std::min<std::size_t>(request.trailer().size, sizeof self.trailer));
+    if (self.whileServing) self.whileServing();
+    std::int32_t sum = 0;
+    if (request.isComplex()) {
+      std::size_t at = kDescriptorsOffset;
+      for (std::uint32_t i = 0; i < request.descriptorCount(); ++i) {
+        if (request.at<std::uint8_t>(at + 11) == kPortDescriptorType) {
+          self.names.push_back(request.at<PortDescriptor>(at).name);
+          at += sizeof(PortDescriptor);
+          continue;
+        }
+        const auto& descriptor = request.at<OutOfLineDescriptor>(at);
+        const auto* const bytes = reinterpret_cast<const unsigned char*>(descriptor.address);
+        for (std::uint32_t k = 0; k < descriptor.size; ++k) sum += bytes[k];
+        at += sizeof(OutOfLineDescriptor);
+      }
+    }
+    switch (request.header().id) {
+      case kRegion: {
+        const auto length = request.at<std::uint32_t>(32);
+        void* address = nullptr;
+        if (self.regions_.allocate(&address, length) != kern::success) break;
+        std::memset(address, 'r', length);
+        auto& out = reply.as<OutOfLineReply>();
+        out.header.bits = kReplyDisposition | kComplexBit;
+        out.header.size = sizeof out;
+        out.descriptorCount = 1;
+        out.payload = {reinterpret_cast<std::uint64_t>(address), 1, 1, 0, kOutOfLineDescriptorType, length};
+        out.byteCount = length;
+        return Outcome::accepted;
+      }
+      case kGiveRight: {
+        auto& out = reply.as<CheckInReply>();
+        out.header.bits = kReplyDisposition | kComplexBit;
+        out.header.size = sizeof out;
+        out.descriptorCount = 1;
+        out.servicePort = {self.given, 0, 0, kDispositionCopySend, kPortDescriptorType};
+        return Outcome::accepted;
+      }
+      case kKeepRight: reply.setStatus(0); return Outcome::accepted;
+      case kRefuse: reply.setStatus(kern::failure); return Outcome::refused;
+      case kThrow: throw std::bad_alloc();
+      default: reply.setStatus(sum); return Outcome::accepted;
+    }
+    reply.setStatus(kern::resourceShortage);
+    return Outcome::refused;
+  }
+  SystemRegions& regions_;
+};
+
+class PortsTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_NE(loop, nullptr);
+    ASSERT_EQ(ports.allocateReceiveRight(&port), kern::success);
+    ASSERT_EQ(ports.insertSendRight(port), kern::success);
+    source = sources.makeRoutineSource(port, table, WantTrailer::no);
+    ASSERT_TRUE(source->addTo(*loop));
+    client = UniqueFd(::fcntl(ports.sendEnd(port)->get(), F_DUPFD_CLOEXEC, 0));
+  }
+
+  static bool sendTo(int fd, const Datagram& datagram) {
+    iovec io{const_cast<std::byte*>(datagram.bytes.data()), datagram.bytes.size()};
+    msghdr raw{};
+    raw.msg_iov = &io;
+    raw.msg_iovlen = 1;
+    std::vector<char> control(CMSG_SPACE(sizeof(int) * datagram.fds.size()));
+    if (!datagram.fds.empty()) {
+      raw.msg_control = control.data();
+      raw.msg_controllen = control.size();
+      cmsghdr* const item = CMSG_FIRSTHDR(&raw);
+      item->cmsg_level = SOL_SOCKET;
+      item->cmsg_type = SCM_RIGHTS;
+      item->cmsg_len = CMSG_LEN(sizeof(int) * datagram.fds.size());
+      std::memcpy(CMSG_DATA(item), datagram.fds.data(), sizeof(int) * datagram.fds.size());
+    }
+    return ::sendmsg(fd, &raw, MSG_NOSIGNAL | MSG_DONTWAIT) == static_cast<ssize_t>(datagram.bytes.size());
+  }
+  // Serves what is ready, and no more.
+  void pump() {
+    while (loop->run(0s, ReturnAfterSource::yes) == RunResult::handledSource) {
+    }
+  }
+  struct Answer {
+    std::vector<std::byte> bytes;
+    std::vector<UniqueFd> fds;
+    const MessageHeader& header() const { return *reinterpret_cast<const MessageHeader*>(bytes.data()); }
+    KernelReturn code() const {
+      EXPECT_EQ(bytes.size(), 36U);
+      return reinterpret_cast<const StatusReply*>(bytes.data())->returnCode;
+    }
+  };
+  static std::optional<Answer> receiveFrom(int fd) {
+    Answer answer;
+    answer.bytes.resize(kLargestDatagram);
+    iovec io{answer.bytes.data(), answer.bytes.size()};
+    std::array<char, 256> control{};
+    msghdr raw{};
+    raw.msg_iov = &io;
+    raw.msg_iovlen = 1;
+    raw.msg_control = control.data();
+    raw.msg_controllen = control.size();
+    const ssize_t size = ::recvmsg(fd, &raw, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+    if (size <= 0) return std::nullopt;
+    answer.bytes.resize(static_cast<std::size_t>(size));
+    for (cmsghdr* item = CMSG_FIRSTHDR(&raw); item != nullptr; item = CMSG_NXTHDR(&raw, item)) {
+      int received = -1;
+      std::memcpy(&received, CMSG_DATA(item), sizeof received);
+      answer.fds.emplace_back(received);
+    }
+    return answer;
+  }
+  std::optional<Answer> exchange(const Datagram& datagram) {
+    EXPECT_TRUE(sendTo(client.get(), datagram));
+    pump();
+    return receiveFrom(client.get());
+  }
+  KernelReturn codeOf(const Datagram& datagram) {
+    const auto answer = exchange(datagram);
+    if (!answer) {
+      ADD_FAILURE() << "no answer";
+      return 0;
+    }
+    return answer->code();
+  }
+  static UniqueFd memfd(std::string_view content, int seals = F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE) {
+    UniqueFd fd(::memfd_create("test", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+    EXPECT_EQ(::write(fd.get(), content.data(), content.size()), static_cast<ssize_t>(content.size()));
+    if (seals != 0) {
+      EXPECT_EQ(::fcntl(fd.get(), F_ADD_SEALS, seals), 0);
+    }
+    return fd;
+  }
+  static std::pair<UniqueFd, UniqueFd> pair(int type = SOCK_SEQPACKET) {
+    std::array<int, 2> ends{};
+    EXPECT_EQ(::socketpair(AF_UNIX, type | SOCK_CLOEXEC, 0, ends.data()), 0);
+    return {UniqueFd(ends[0]), UniqueFd(ends[1])};
+  }
+
+  RecordingLog log;
+  std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
+  SystemPortSpace ports;
+  SystemRegions regions;
+  SystemPortSources sources{ports, regions};
+  TestTable table{regions};
+  PortName port = kNullPort;
+  std::shared_ptr<RoutineSource> source;
+  UniqueFd client;
+};
+
+// ---- names and rights ----
+
+TEST_F(PortsTest, NamesAreNeverNullOrDeadAndAFreedOneIsNotHandedOutAgainSoon) {
+  std::vector<PortName> seen;
+  for (int i = 0; i < 1000; ++i) {
+    PortName name = kNullPort;
+    ASSERT_EQ(ports.allocateReceiveRight(&name), kern::success);
+    EXPECT_TRUE(isUsablePort(name));
+    EXPECT_EQ(std::count(seen.begin(), seen.end(), name), 0);
+    seen.push_back(name);
+    EXPECT_EQ(ports.dropReceiveRight(name), kern::success);
+  }
+}
+
+TEST_F(PortsTest, RightsThatAreNotThereAreRefused) {
+  EXPECT_EQ(ports.dropReceiveRight(kNullPort), kern::invalidName);
+  EXPECT_EQ(ports.deallocateSendRight(kDeadPort), kern::invalidName);
+  EXPECT_EQ(ports.insertSendRight(0x7777), kern::invalidName);
+  PortName name = kNullPort;
+  ASSERT_EQ(ports.allocateReceiveRight(&name), kern::success);
+  EXPECT_EQ(ports.deallocateSendRight(name), kern::invalidRight);
+  EXPECT_EQ(ports.dropReceiveRight(name), kern::success);
+  EXPECT_EQ(ports.dropReceiveRight(name), kern::invalidName);
+}
+
+TEST_F(PortsTest, ReferencesOfASendRightAreCounted) {
+  EXPECT_EQ(ports.insertSendRight(port), kern::success);
+  EXPECT_EQ(ports.deallocateSendRight(port), kern::success);
+  EXPECT_NE(ports.sendEnd(port), nullptr);
+  EXPECT_EQ(ports.deallocateSendRight(port), kern::success);
+  EXPECT_EQ(ports.sendEnd(port), nullptr);
+}
+
+TEST_F(PortsTest, EveryDescriptorIsCloseOnExec) {
+  const auto answer = exchange(complexMessage(kKeepRight, 0, 28));
+  ASSERT_TRUE(answer);
+  EXPECT_TRUE(::fcntl(ports.receiveEnd(port)->get(), F_GETFD) & FD_CLOEXEC);
+  EXPECT_TRUE(::fcntl(ports.sendEnd(port)->get(), F_GETFD) & FD_CLOEXEC);
+  auto [kept, sent] = pair();
+  Datagram request = complexMessage(kKeepRight, 1, 40).add(right());
+  request.fds = {sent.get()};
+  EXPECT_EQ(codeOf(request), 0);
+  EXPECT_TRUE(::fcntl(ports.sendEnd(table.names.back())->get(), F_GETFD) & FD_CLOEXEC);
+}
+
+// ---- requests and replies ----
+
+TEST_F(PortsTest, AReplyGoesBackOverTheChannelWithTheRequestsReplyPortAndItsIdPlus100) {
+  const auto answer = exchange(message(kEcho, 18, 24, 0xABCD));
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->header().bits, 18U);
+  EXPECT_EQ(answer->header().size, 36U);
+  EXPECT_EQ(answer->header().replyPort, 0U);
+  EXPECT_EQ(answer->header().localPort, 0xABCDU);
+  EXPECT_EQ(answer->header().voucher, 0U);
+  EXPECT_EQ(answer->header().id, kEcho + 100);
+  EXPECT_EQ(table.arrivedOn, port);
+}
+
+TEST_F(PortsTest, ARequestWithoutReplyPortIsServedAndNotAnswered) {
+  EXPECT_FALSE(exchange(message(kEcho, 0, 24, 0)));
+  EXPECT_EQ(table.served, 1);
+  EXPECT_FALSE(exchange(message(999, 0, 24, 0)));
+  EXPECT_FALSE(exchange(message(kRegion, 0, 24, 0).padTo(40)));
+  EXPECT_EQ(regions.live(), 0U);
+}
+
+TEST_F(PortsTest, AnUnknownIdIsAnsweredWithMinus303) {
+  EXPECT_EQ(codeOf(message(99)), -303);
+  EXPECT_EQ(codeOf(message(INT32_MAX)), -303) << "the reply's id wraps";
+  EXPECT_EQ(table.served, 0);
+}
+
+TEST_F(PortsTest, WithoutInLineRegionsTheSizeIsTheDatagramsOwnWhateverTheSenderWrote) {
+  for (const std::uint32_t written : {0U, 1U, 24U, 65536U, 0xFFFFFFFFU}) {
+    codeOf(message(kEcho, 18, written).padTo(60));
+    EXPECT_EQ(table.sizes.back(), 60U);
+  }
+}
+
+TEST_F(PortsTest, AMessageShorterThanAHeaderIsDroppedInSilenceAndItsDescriptorsAreClosed) {
+  const std::size_t before = openDescriptors();
+  for (std::size_t size = 1; size < 24; ++size) {
+    Datagram datagram;
+    datagram.padTo(size);
+    datagram.fds = {client.get()};
+    EXPECT_FALSE(exchange(datagram)) << size;
+  }
+  EXPECT_EQ(openDescriptors(), before);
+  EXPECT_EQ(codeOf(message(kEcho)), 0) << "the channel goes on";
+}
+
+TEST_F(PortsTest, ADatagramOfMoreThan65536BytesIsRefused) {
+  EXPECT_EQ(codeOf(message(kEcho).padTo(65536)), 0);
+  EXPECT_EQ(codeOf(message(kEcho).padTo(65537)), -304);
+  EXPECT_EQ(table.served, 1);
+}
+
+TEST_F(PortsTest, WhenMemoryRunsOutInARoutineTheRequestFailsAndTheProcessGoesOn) {
+  EXPECT_EQ(codeOf(message(kThrow)), kern::resourceShortage);
+  EXPECT_EQ(codeOf(message(kEcho)), 0);
+}
+
+TEST_F(PortsTest, AMessageNobodyAskedATrailerForHasTypeAndSizeOnly) {
+  codeOf(message(kEcho));
+  EXPECT_EQ(table.trailer.type, 0U);
+  EXPECT_EQ(table.trailer.size, 8U);
+}
+
+// ---- regions of requests ----
+
+TEST_F(PortsTest, RegionsTravelInLineInDescriptorOrder) {
+  Datagram datagram = complexMessage(kEcho, 2, 60).add(region(64, 3)).add(region(72, 2)).text("\x01\x02\x03");
+  datagram.bytes.resize(60);
+  datagram.padTo(64).text("\x01\x02\x03").padTo(72).text("\x10\x20");
+  EXPECT_EQ(codeOf(datagram), 1 + 2 + 3 + 0x10 + 0x20);
+  EXPECT_EQ(table.sizes.back(), 60U);
+}
+
+TEST_F(PortsTest, RegionsTravelAsSealedMemfds) {
+  const UniqueFd first = memfd("\x01\x02\x03");
+  const UniqueFd second = memfd("\x04\x05\x06");
+  Datagram datagram = complexMessage(kEcho, 2, 60).add(region(0, 3)).add(region(0, 2));
+  datagram.fds = {first.get(), second.get()};
+  const std::size_t before = openDescriptors();
+  EXPECT_EQ(codeOf(datagram), 1 + 2 + 3 + 4 + 5);
+  EXPECT_EQ(openDescriptors(), before);
+}
+
+TEST_F(PortsTest, BothWaysMayMixAndAnEmptyRegionCarriesNothing) {
+  const UniqueFd sealed = memfd("\x05");
+  Datagram datagram =
+      complexMessage(kEcho, 3, 76).add(region(0, 1)).add(region(80, 1)).add(region(0xDEAD, 0)).padTo(80).text("\x07");
+  datagram.fds = {sealed.get()};
+  EXPECT_EQ(codeOf(datagram), 12);
+}
+
+TEST_F(PortsTest, ARegionThatNoCorrectSenderMakesIsRefused) {
+  struct Case {
+    const char* what;
+    Datagram datagram;
+  };
+  const auto inLine = [](std::uint64_t address, std::uint32_t size, std::uint32_t messageSize, std::size_t length) {
+    return complexMessage(kEcho, 1, messageSize).add(region(address, size)).padTo(length);
+  };
+  std::vector<Case> cases;
+  cases.push_back({"outside the datagram", inLine(48, 9, 44, 56)});
+  cases.push_back({"far outside", inLine(0x4000000000000000, 8, 44, 56)});
+  cases.push_back({"wrapping around", inLine(0xFFFFFFFFFFFFFFF8, 0xFFFFFFFF, 44, 56)});
+  cases.push_back({"unaligned", inLine(45, 8, 44, 53)});
+  cases.push_back({"not where the size says", inLine(56, 8, 44, 64)});
+  cases.push_back({"inside the message", inLine(24, 8, 44, 44)});
+  cases.push_back({"the size beyond the datagram", inLine(48, 8, 60, 56)});
+  cases.push_back({"the size before the descriptor's end", inLine(40, 8, 40, 48)});
+  cases.push_back({"bytes after the last region", inLine(48, 8, 44, 57)});
+  cases.push_back({"out of order",
+                   complexMessage(kEcho, 2, 60).add(region(72, 8)).add(region(64, 8)).padTo(80)});
+  cases.push_back({"overlapping", complexMessage(kEcho, 2, 60).add(region(64, 9)).add(region(72, 8)).padTo(80)});
+  cases.push_back({"the second unaligned",
+                   complexMessage(kEcho, 2, 60).add(region(64, 3)).add(region(67, 3)).padTo(70)});
+  for (const Case& one : cases) EXPECT_EQ(codeOf(one.datagram), -304) << one.what;
+  EXPECT_EQ(table.served, 0);
+}
+
+TEST_F(PortsTest, AMemfdMustBeSealedAndAsLongAsItSays) {
+  const std::size_t before = openDescriptors();
+  const auto refused = [&](const UniqueFd& fd, std::uint32_t size) {
+    Datagram datagram = complexMessage(kEcho, 1, 44).add(region(0, size));
+    datagram.fds = {fd.get()};
+    EXPECT_EQ(codeOf(datagram), -304);
+  };
+  refused(memfd("abc", 0), 3);
+  refused(memfd("abc", F_SEAL_SHRINK | F_SEAL_GROW), 3);
+  refused(memfd("abc", F_SEAL_GROW | F_SEAL_WRITE), 3);
+  refused(memfd("abc", F_SEAL_SHRINK | F_SEAL_WRITE), 3);
+  refused(memfd("abc"), 4);
+  refused(UniqueFd(::open("/dev/zero", O_RDONLY | O_CLOEXEC)), 3);
+  refused(std::move(pair().first), 3);
+  EXPECT_EQ(table.served, 0);
+  EXPECT_EQ(openDescriptors(), before);
+}
+
+TEST_F(PortsTest, MoreOrFewerDescriptorsThanTheWalkAsksForAreRefusedAndClosed) {
+  const UniqueFd sealed = memfd("abc");
+  const std::size_t before = openDescriptors();
+  Datagram simple = message(kEcho);
+  simple.fds = {sealed.get()};
+  EXPECT_EQ(codeOf(simple), -304);
+  Datagram none = complexMessage(kEcho, 1, 44).add(region(0, 3));
+  EXPECT_EQ(codeOf(none), -304);
+  Datagram two = none;
+  two.fds = {sealed.get(), sealed.get()};
+  EXPECT_EQ(codeOf(two), -304);
+  Datagram many = none;
+  many.fds.assign(253, sealed.get());
+  EXPECT_EQ(codeOf(many), -304);
+  EXPECT_EQ(openDescriptors(), before);
+  EXPECT_EQ(table.served, 0);
+}
+
+TEST_F(PortsTest, TheWalkEndsAtAnUnknownTypeAndAtADescriptorThatIsCutOff) {
+  OutOfLineDescriptor odd = region(0, 0);
+  odd.type = 9;
+  EXPECT_EQ(codeOf(message(98, kComplexBit | 18).add(1U).add(odd)), -303) << "well formed, and unknown";
+  Datagram cut = message(98, kComplexBit | 18).add(2U).add(right());
+  cut.padTo(51);  // one byte short of a second port descriptor
+  auto [kept, sent] = pair();
+  cut.fds = {sent.get()};
+  EXPECT_EQ(codeOf(cut), -303);
+  EXPECT_EQ(codeOf(message(98, kComplexBit | 18)), -303) << "complex, without room for a count";
+}
+
+// ---- rights of requests ----
+
+TEST_F(PortsTest, ARightMustBeASeqpacketSocketOfTheUnixFamily) {
+  const std::size_t before = openDescriptors();
+  const auto refused = [&](const UniqueFd& fd) {
+    Datagram datagram = complexMessage(kKeepRight, 1, 40).add(right());
+    datagram.fds = {fd.get()};
+    EXPECT_EQ(codeOf(datagram), -304);
+  };
+  refused(std::move(pair(SOCK_STREAM).first));
+  refused(std::move(pair(SOCK_DGRAM).first));
+  refused(UniqueFd(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)));
+  refused(UniqueFd(::open("/dev/null", O_RDONLY | O_CLOEXEC)));
+  refused(memfd("x"));
+  EXPECT_EQ(table.served, 0);
+  EXPECT_EQ(openDescriptors(), before);
+  EXPECT_EQ(ports.size(), 1U);
+}
+
+TEST_F(PortsTest, ARightThatTheRoutineTookOverIsKeptAndOneOfARefusedRequestIsReleased) {
+  auto [kept, sent] = pair();
+  Datagram datagram = complexMessage(kKeepRight, 1, 40).add(right());
+  datagram.fds = {sent.get()};
+  EXPECT_EQ(codeOf(datagram), 0);
+  EXPECT_NE(ports.sendEnd(table.names.at(0)), nullptr);
+  datagram = complexMessage(kRefuse, 1, 40).add(right());
+  datagram.fds = {sent.get()};
+  EXPECT_EQ(codeOf(datagram), 5);
+  EXPECT_EQ(ports.sendEnd(table.names.at(1)), nullptr);
+  datagram = complexMessage(99, 1, 40).add(right());
+  datagram.fds = {sent.get()};
+  EXPECT_EQ(codeOf(datagram), -303);
+  EXPECT_EQ(ports.size(), 2U);
+  sent.reset();
+  ports.deallocateSendRight(table.names.at(0));
+  pollfd hungUp{kept.get(), POLLIN, 0};
+  EXPECT_EQ(::poll(&hungUp, 1, 0), 1) << "nobody holds the other end any more";
+}
+
+TEST_F(PortsTest, ACheckInReplyCarriesACopyOfTheSendRight) {
+  PortName other = kNullPort;
+  ASSERT_EQ(ports.allocateReceiveRight(&other), kern::success);
+  ASSERT_EQ(ports.insertSendRight(other), kern::success);
+  table.given = other;
+  const auto answer = exchange(message(kGiveRight));
+  ASSERT_TRUE(answer);
+  const auto& reply = *reinterpret_cast<const CheckInReply*>(answer->bytes.data());
+  EXPECT_EQ(reply.servicePort.name, 0U);
+  EXPECT_EQ(reply.servicePort.disposition, 19);
+  ASSERT_EQ(answer->fds.size(), 1U);
+  EXPECT_NE(ports.sendEnd(other), nullptr) << "the helper keeps its own";
+  const auto second = sources.makeRoutineSource(other, table, WantTrailer::no);
+  ASSERT_TRUE(second->addTo(*loop));
+  ASSERT_TRUE(sendTo(answer->fds[0].get(), message(kEcho)));
+  pump();
+  EXPECT_EQ(table.arrivedOn, other);
+}
+
+// ---- regions of replies ----
+
+TEST_F(PortsTest, ARegionThatFitsTheDatagramTravelsInLineAndALargerOneAsASealedMemfd) {
+  for (const std::uint32_t length : {1U, 5U, 4096U, 65480U, 65481U, 200000U}) {
+    const auto answer = exchange(message(kRegion).add(kNdrRecord).add(length));
+    ASSERT_TRUE(answer);
+    const auto& reply = *reinterpret_cast<const OutOfLineReply*>(answer->bytes.data());
+    EXPECT_EQ(reply.header.size, 56U);
+    EXPECT_EQ(reply.payload.size, length);
+    if (length <= 65480) {
+      EXPECT_EQ(reply.payload.address, 56U);
+      EXPECT_EQ(answer->bytes.size(), 56 + length);
+      EXPECT_EQ(answer->bytes.back(), std::byte{'r'});
+      EXPECT_TRUE(answer->fds.empty());
+    } else {
+      EXPECT_EQ(reply.payload.address, 0U);
+      ASSERT_EQ(answer->fds.size(), 1U);
+      const int seals = ::fcntl(answer->fds[0].get(), F_GET_SEALS);
+      EXPECT_EQ(seals & (F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE), F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE);
+      struct stat status{};
+      ::fstat(answer->fds[0].get(), &status);
+      EXPECT_EQ(status.st_size, length);
+    }
+    EXPECT_EQ(regions.live(), 0U);
+  }
+}
+
+TEST_F(PortsTest, AnEmptyRegionHasAddressAndSizeZero) {
+  const auto answer = exchange(message(kRegion).add(kNdrRecord).add(0U));
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->bytes.size(), 56U);
+  EXPECT_EQ(reinterpret_cast<const OutOfLineReply*>(answer->bytes.data())->payload.address, 0U);
+}
+
+TEST_F(PortsTest, AFullChannelDelaysItsOwnRepliesOnlyAndIsNotReadUntilTheyHaveGoneOut) {
+  const Datagram large = message(kRegion).add(kNdrRecord).add(60000U);
+  int sent = 0;
+  int before = -1;
+  while (table.served != before) {  // until the helper stops reading
+    before = table.served;
+    ASSERT_TRUE(sendTo(client.get(), large));
+    ++sent;
+    pump();
+  }
+  EXPECT_LT(table.served, sent);
+
+  PortName other = kNullPort;
+  ASSERT_EQ(ports.allocateReceiveRight(&other), kern::success);
+  ASSERT_EQ(ports.insertSendRight(other), kern::success);
+  const auto second = sources.makeRoutineSource(other, table, WantTrailer::no);
+  ASSERT_TRUE(second->addTo(*loop));
+  const auto otherEnd = ports.sendEnd(other);
+  ASSERT_TRUE(sendTo(otherEnd->get(), message(kEcho)));
+  pump();
+  EXPECT_TRUE(receiveFrom(otherEnd->get())) << "others are served meanwhile";
+
+  int answers = 0;
+  while (const auto answer = receiveFrom(client.get())) {
+    EXPECT_EQ(answer->bytes.size(), 60056U);
+    ++answers;
+    pump();
+  }
+  EXPECT_EQ(answers, sent) << "every reply came in the end";
+  EXPECT_EQ(regions.live(), 0U);
+}
+
+TEST_F(PortsTest, InvalidatingASourceReleasesTheReplyThatWaited) {
+  const Datagram large = message(kRegion).add(kNdrRecord).add(60000U);
+  for (int i = 0; i < 20; ++i) (void)sendTo(client.get(), large);
+  pump();
+  EXPECT_EQ(regions.live(), 1U);
+  source->invalidate();
+  EXPECT_EQ(regions.live(), 0U);
+}
+
+TEST_F(PortsTest, NoMoreThanABudgetOfOneClientsMessagesIsTakenBeforeTheOthersGetTheirTurn) {
+  PortName other = kNullPort;
+  ASSERT_EQ(ports.allocateReceiveRight(&other), kern::success);
+  ASSERT_EQ(ports.insertSendRight(other), kern::success);
+  const auto second = sources.makeRoutineSource(other, table, WantTrailer::no);
+  ASSERT_TRUE(second->addTo(*loop));
+  for (int i = 0; i < 100; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho, 0, 24, 0)));
+  const auto otherEnd = ports.sendEnd(other);
+  ASSERT_TRUE(sendTo(otherEnd->get(), message(kEcho)));
+  loop->run(0s, ReturnAfterSource::yes);
+  EXPECT_LE(table.served, 9);
+  loop->run(0s, ReturnAfterSource::yes);
+  EXPECT_LE(table.served, 17);
+  EXPECT_TRUE(receiveFrom(otherEnd->get())) << "the other client did not wait for a hundred messages";
+  pump();
+  EXPECT_EQ(table.served, 101);
+}
+
+TEST_F(PortsTest, AClientThatShutsItsChannelIsReadNoMoreAndWakesNobody) {
+  ASSERT_EQ(::shutdown(client.get(), SHUT_RDWR), 0);
+  pump();
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::timedOut);
+}
+
+TEST_F(PortsTest, ARoutineMayInvalidateTheSourceThatCalledIt) {
+  table.whileServing = [&] { source->invalidate(); };
+  EXPECT_FALSE(exchange(message(kRegion).add(kNdrRecord).add(100U)));
+  EXPECT_EQ(regions.live(), 0U);
+}
+
+// ---- death watch ----
+
+TEST_F(PortsTest, DeathOfThePortIsToldOnce) {
+  auto [theirs, ours] = pair();
+  const PortName name = ports.adoptSendRight(std::move(ours));
+  int info = 0;
+  const auto watch = sources.makeDeathWatch(name, *loop, &info);
+  ASSERT_NE(watch, nullptr);
+  int told = 0;
+  watch->setInvalidationCallback([&](DeathWatch& dead) {
+    EXPECT_EQ(dead.port(), name);
+    EXPECT_EQ(dead.info(), &info);
+    EXPECT_FALSE(dead.isValid());
+    ++told;
+  });
+  EXPECT_TRUE(watch->isValid());
+  ASSERT_EQ(::send(theirs.get(), "noise", 5, 0), 5);
+  pump();
+  EXPECT_EQ(told, 0) << "what the port says is not its death";
+  theirs.reset();
+  EXPECT_FALSE(watch->isValid()) << "dead as soon as the kernel says so";
+  pump();
+  EXPECT_EQ(told, 1);
+}
+
+TEST_F(PortsTest, APortThatDiedBeforeItWasWatchedIsToldAfterTheCallbackIsSetAndAfterItsNameIsFreed) {
+  auto [theirs, ours] = pair();
+  theirs.reset();
+  const PortName name = ports.adoptSendRight(std::move(ours));
+  const auto watch = sources.makeDeathWatch(name, *loop, nullptr);
+  EXPECT_FALSE(watch->isValid());
+  int told = 0;
+  watch->setInvalidationCallback([&](DeathWatch&) { ++told; });
+  EXPECT_EQ(ports.deallocateSendRight(name), kern::success);
+  pump();
+  EXPECT_EQ(told, 1);
+}
+
+TEST_F(PortsTest, AnInvalidatedWatchTellsNothing) {
+  auto [theirs, ours] = pair();
+  const auto watch = sources.makeDeathWatch(ports.adoptSendRight(std::move(ours)), *loop, nullptr);
+  watch->setInvalidationCallback([](DeathWatch&) { ADD_FAILURE(); });
+  watch->invalidate();
+  theirs.reset();
+  pump();
+  EXPECT_FALSE(watch->isValid());
+}
+
+TEST_F(PortsTest, AWatchOrSourceOnANameWithoutItsRightIsRefused) {
+  EXPECT_EQ(sources.makeDeathWatch(0x4242, *loop, nullptr), nullptr);
+  EXPECT_EQ(sources.makeRoutineSource(0x4242, table, WantTrailer::no), nullptr);
+}
+
+// ---- the service port ----
+
+class ServiceTest : public PortsTest {
+ protected:
+  void SetUp() override {
+    PortsTest::SetUp();
+    std::string name = (std::filesystem::temp_directory_path() / "brenvik-ports-XXXXXX").string();
+    ASSERT_NE(::mkdtemp(name.data()), nullptr);
+    directory = name;
+  }
+  void TearDown() override { std::filesystem::remove_all(directory); }
+
+  std::string path() const { return directory + "/service"; }
+  void listen() {
+    ASSERT_EQ(bootstrap().checkIn("service", &service), kern::success);
+    serviceSource = sources.makeRoutineSource(service, table, WantTrailer::yes);
+    ASSERT_TRUE(serviceSource->addTo(*loop));
+  }
+  SystemBootstrap bootstrap() { return {ports, directory}; }
+  UniqueFd connect() {
+    UniqueFd fd(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strcpy(address.sun_path, path().c_str());
+    if (::connect(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) fd.reset();
+    return fd;
+  }
+  static bool isClosed(const UniqueFd& fd) {
+    char byte = 0;
+    return ::recv(fd.get(), &byte, 1, MSG_DONTWAIT | MSG_PEEK) == 0;
+  }
+
+  std::string directory;
+  PortName service = kNullPort;
+  std::shared_ptr<RoutineSource> serviceSource;
+};
+
+TEST_F(ServiceTest, TheSocketFileIsMadeForEverybodyAndGoesWithTheRight) {
+  directory += "/a/b";
+  listen();
+  struct stat status{};
+  ASSERT_EQ(::stat(path().c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0666U);
+  serviceSource->invalidate();
+  EXPECT_EQ(ports.dropReceiveRight(service), kern::success);
+  EXPECT_NE(::stat(path().c_str(), &status), 0);
+}
+
+TEST_F(ServiceTest, AStaleSocketFileIsReplaced) {
+  {
+    const UniqueFd dead(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strcpy(address.sun_path, path().c_str());
+    ASSERT_EQ(::bind(dead.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+  }
+  listen();
+  EXPECT_TRUE(connect().isValid());
+}
+
+TEST_F(ServiceTest, ANameThatALiveProcessHoldsIsRefusedAndSaidWhy) {
+  listen();
+  PortName second = kNullPort;
+  EXPECT_EQ(bootstrap().checkIn("service", &second), kern::noAccess);
+  EXPECT_EQ(second, kNullPort);
+  EXPECT_EQ(log.entries().back(),
+            RecordingLog::unifiedLine(LogLevel::error, "another process already serves " + path()));
+  EXPECT_TRUE(connect().isValid()) << "the first is not disturbed";
+}
+
+TEST_F(ServiceTest, AFileThatIsNoSocketIsLeftAlone) {
+  std::filesystem::create_directory(path());
+  PortName name = kNullPort;
+  EXPECT_EQ(bootstrap().checkIn("service", &name), kern::noAccess);
+  EXPECT_TRUE(std::filesystem::is_directory(path()));
+}
+
+TEST_F(ServiceTest, APathTooLongForASocketIsRefused) {
+  directory += "/" + std::string(120, 'x');
+  PortName name = kNullPort;
+  EXPECT_EQ(bootstrap().checkIn("service", &name), kern::noAccess);
+}
+
+TEST_F(ServiceTest, AnotherInstancesSocketFileIsNotRemovedAtTheEnd) {
+  listen();
+  ::unlink(path().c_str());
+  std::filesystem::create_directory(path());
+  serviceSource->invalidate();
+  EXPECT_EQ(ports.dropReceiveRight(service), kern::success);
+  EXPECT_TRUE(std::filesystem::exists(path()));
+}
+
+TEST_F(ServiceTest, MessagesOfTheServicePortCarryTheKernelsWordOnTheirSender) {
+  listen();
+  const UniqueFd connection = connect();
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  pump();
+  EXPECT_EQ(table.served, 2);
+  EXPECT_EQ(table.trailer.type, 0U);
+  EXPECT_EQ(table.trailer.size, 52U);
+  EXPECT_EQ(table.trailer.sequence, 1U);
+  EXPECT_EQ(table.trailer.senderUid, ::getuid());
+  EXPECT_EQ(table.trailer.senderGid, ::getgid());
+  EXPECT_EQ(table.trailer.auditToken[1], ::getuid());
+  EXPECT_EQ(table.trailer.auditToken[5], static_cast<std::uint32_t>(::getpid()));
+  EXPECT_EQ(table.trailer.auditToken[6], static_cast<std::uint32_t>(::getsid(0)));
+  EXPECT_NE(table.trailer.auditToken[7], 0U);
+}
+
+TEST_F(ServiceTest, AMessageOfAnotherProcessThanTheConnectionsIsRefusedWith35WhereTheKernelCanTell) {
+  listen();
+  const UniqueFd connection = connect();
+  if (pinPeer(connection.get(), ::getpid()) == PeerPin::unsupported) {
+    GTEST_SKIP() << "this kernel has no SO_PEERPIDFD (Linux 6.5)";
+  }
+  const pid_t child = ::fork();
+  if (child == 0) ::_exit(sendTo(connection.get(), message(kEcho)) ? 0 : 1);
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  pump();
+  const auto answer = receiveFrom(connection.get());
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->code(), 35);
+  EXPECT_EQ(table.served, 0);
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  pump();
+  EXPECT_EQ(table.served, 1) << "the connection's own process is heard";
+}
+
+TEST_F(ServiceTest, AConnectionWhosePeerIsGoneIsRefusedWhereTheKernelCanTell) {
+  listen();
+  const UniqueFd probe = connect();
+  if (pinPeer(probe.get(), ::getpid()) == PeerPin::unsupported) {
+    GTEST_SKIP() << "this kernel has no SO_PEERPIDFD (Linux 6.5)";
+  }
+  const pid_t child = ::fork();
+  if (child == 0) {
+    const UniqueFd connection = connect();
+    ::_exit(sendTo(connection.get(), message(kEcho)) ? 0 : 1);
+  }
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  ASSERT_EQ(status, 0);
+  pump();
+  EXPECT_EQ(table.served, 0);
+}
+
+TEST_F(ServiceTest, ConnectionsThatNeverCheckInAreLimitedAndTheOldestGoesFirst) {
+  listen();
+  std::vector<UniqueFd> connections;
+  for (int i = 0; i < 80; ++i) {
+    connections.push_back(connect());
+    pump();
+  }
+  EXPECT_TRUE(isClosed(connections.front()));
+  EXPECT_FALSE(isClosed(connections.back()));
+  EXPECT_EQ(std::count_if(connections.begin(), connections.end(), isClosed), 80 - 64);
+  ASSERT_TRUE(sendTo(connections.back().get(), message(kEcho)));
+  pump();
+  EXPECT_TRUE(receiveFrom(connections.back().get()));
+}
+
+TEST_F(ServiceTest, AnAdmittedConnectionIsNotGivenUpForOthers) {
+  listen();
+  const UniqueFd admitted = connect();
+  ASSERT_TRUE(sendTo(admitted.get(), message(kEcho)));
+  pump();
+  ASSERT_TRUE(receiveFrom(admitted.get()));
+  std::vector<UniqueFd> others;
+  for (int i = 0; i < 100; ++i) {
+    others.push_back(connect());
+    pump();
+  }
+  EXPECT_FALSE(isClosed(admitted));
+}
+
+TEST_F(ServiceTest, RunningOutOfDescriptorsNeitherKillsAcceptNorSpins) {
+  listen();
+  const UniqueFd waiting = connect();
+  rlimit old{};
+  ::getrlimit(RLIMIT_NOFILE, &old);
+  std::vector<UniqueFd> fillers;
+  const rlimit tight{std::min<rlim_t>(old.rlim_max, 256), old.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &tight), 0);
+  for (;;) {
+    UniqueFd filler(::dup(0));
+    if (!filler.isValid()) break;
+    fillers.push_back(std::move(filler));
+  }
+  pump();  // takes the waiting connection off the queue, unserved
+  EXPECT_TRUE(isClosed(waiting));
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::timedOut);
+  fillers.clear();
+  ::setrlimit(RLIMIT_NOFILE, &old);
+  const UniqueFd later = connect();
+  ASSERT_TRUE(sendTo(later.get(), message(kEcho)));
+  pump();
+  EXPECT_TRUE(receiveFrom(later.get()));
+}
+
+TEST_F(ServiceTest, InvalidatingTheServiceGivesEveryConnectionEndOfFile) {
+  listen();
+  const UniqueFd connection = connect();
+  pump();
+  serviceSource->invalidate();
+  EXPECT_TRUE(isClosed(connection));
+}
+
+}  // namespace
+}  // namespace brenvik
