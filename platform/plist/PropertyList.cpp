@@ -78,7 +78,7 @@ PropertyList share(const Node& child, const Document* owner) noexcept {
 
 Node keyNode(std::string_view key) noexcept {
   Node node = scalar(Tag::string);
-  node.text = key.data();
+  node.text = key.empty() ? "" : key.data();  // never null: it is compared
   node.size = static_cast<std::uint32_t>(key.size());
   plist::setKeyHash(node);
   return node;
