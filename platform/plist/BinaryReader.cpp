@@ -350,14 +350,12 @@ bool Reader::walk() {
       return false;  // a container within itself
     }
     // The frame may have moved only in the case left above.
-    if (node.isContainer() && node.size != 0) {
-      const Measure& child = done_[slot.done];
-      frame.measure.extent.addChild(child.extent);
-      frame.measure.height = std::max(frame.measure.height, child.height + 1);
-      if (frames_.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
-    } else {
-      frame.measure.extent.addChild(largestExtent(node));
-    }
+    const bool isFull = node.isContainer() && node.size != 0;
+    const Measure child =
+        isFull ? done_[slot.done] : Measure{largestExtent(node), std::size_t{node.isContainer()}};
+    frame.measure.extent.addChild(child.extent);
+    frame.measure.height = std::max(frame.measure.height, child.height + 1);
+    if (frames_.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
     if (!frame.isDictionary) {
       frame.children[frame.next] = node;
     } else {

@@ -179,14 +179,11 @@ bool Writer::number(const Node& root) {
       if (!enter(child)) return false;
       continue;
     }
-    if (isFull) {
-      const Measure& measure = done_[objects_[object].done];
-      frame.measure.extent.addChild(measure.extent);
-      frame.measure.height = std::max(frame.measure.height, measure.height + 1);
-      if (frames_.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
-    } else {
-      frame.measure.extent.addChild(largestExtent(child));
-    }
+    const Measure measure = isFull ? done_[objects_[object].done]
+                                   : Measure{largestExtent(child), std::size_t{child.isContainer()}};
+    frame.measure.extent.addChild(measure.extent);
+    frame.measure.height = std::max(frame.measure.height, measure.height + 1);
+    if (frames_.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
     // All the keys stand before all the values.
     std::size_t slot = frame.next;
     if (inDictionary) slot = frame.next / 2 + (frame.next % 2 == 0 ? 0 : frame.count / 2);

@@ -2,7 +2,6 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/plist/XmlSize.h"
 
-#include <algorithm>
 #include <unordered_map>
 #include <vector>
 
@@ -10,31 +9,23 @@
 #include "platform/plist/XmlWriter.h"
 
 namespace brenvik::plist {
-namespace {
-
-struct Measure {
-  XmlExtent extent;
-  std::size_t height = 0;  // levels of containers
-};
-
-}  // namespace
 
 bool xmlFormFits(const Node& root) {
   struct Frame {
     const Node* node;
     std::size_t next;
-    Measure measure;
+    XmlExtent extent;
   };
-  std::unordered_map<const Node*, Measure> known;
+  std::unordered_map<const Node*, XmlExtent> known;  // by children
   std::vector<Frame> frames;
   const Node& top = resolved(root);
   if (!top.isContainer() || top.size == 0) return fitsXmlLimit(xmlExtentOf(top));
-  frames.push_back({&top, 0, {tagExtent(top.tag), 1}});
+  frames.push_back({&top, 0, tagExtent(top.tag)});
   while (true) {
     Frame& frame = frames.back();
     if (frame.next == frame.node->childCount()) {
-      const Measure done = frame.measure;
-      if (!fitsXmlLimit(done.extent)) return false;
+      const XmlExtent done = frame.extent;
+      if (!fitsXmlLimit(done)) return false;
       known.emplace(frame.node->children, done);
       frames.pop_back();
       if (frames.empty()) return true;
@@ -43,19 +34,14 @@ bool xmlFormFits(const Node& root) {
     const bool isKey = frame.node->tag == Tag::dictionary && frame.next % 2 == 0;
     const Node& child = resolved(frame.node->children[frame.next]);
     if (!child.isContainer() || child.size == 0) {
-      frame.measure.extent.addChild(isKey ? xmlExtentOfKey(child) : xmlExtentOf(child));
-      ++frame.next;
+      frame.extent.addChild(isKey ? xmlExtentOfKey(child) : xmlExtentOf(child));
+    } else if (const auto found = known.find(child.children); found != known.end()) {
+      frame.extent.addChild(found->second);
+    } else {
+      frames.push_back({&child, 0, tagExtent(child.tag)});
       continue;
     }
-    if (const auto found = known.find(child.children); found != known.end()) {
-      frame.measure.extent.addChild(found->second.extent);
-      frame.measure.height = std::max(frame.measure.height, found->second.height + 1);
-      if (frames.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
-      ++frame.next;
-      continue;
-    }
-    if (frames.size() == kDeepestPropertyList) return false;
-    frames.push_back({&child, 0, {tagExtent(child.tag), 1}});
+    ++frame.next;
   }
 }
 

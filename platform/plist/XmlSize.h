@@ -53,7 +53,7 @@ inline bool fitsXmlLimit(const XmlExtent& extent) noexcept {
 }
 
 // Whether the value as XML keeps to kLargestXmlForm: exact, in time linear in what is stored, however much
-// of it is shared. False, too, when nested deeper than kDeepestPropertyList. Throws std::bad_alloc.
+// of it is shared. Nesting is the caller's to limit. Throws std::bad_alloc.
 bool xmlFormFits(const Node& root);
 
 }  // namespace brenvik::plist

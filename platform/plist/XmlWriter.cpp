@@ -297,8 +297,8 @@ std::optional<std::string> Writer::write(const Node& root) {
   put(kXmlHead);
   const Node* value = &resolved(root);
   while (!failed_) {
+    if (value->isContainer() && frames.size() == kDeepestPropertyList) return std::nullopt;
     if (value->isContainer() && value->size != 0) {
-      if (frames.size() == kDeepestPropertyList) return std::nullopt;
       const bool isDictionary = value->tag == Tag::dictionary;
       reserve(kElementRoom);
       indent();
