@@ -52,7 +52,7 @@ function(brenvik_tests target)
   set_target_properties(${target}_tests PROPERTIES RUNTIME_OUTPUT_DIRECTORY ${PROJECT_BINARY_DIR}/unit)
   target_link_libraries(${target}_tests PRIVATE brenvik_flags ${target} ${ARG_DEPENDS} GTest::gmock_main Threads::Threads)
   add_test(NAME ${target} COMMAND ${target}_tests)
-  set_tests_properties(${target} PROPERTIES LABELS "unit;${ARG_LABELS}" TIMEOUT 300)
+  set_tests_properties(${target} PROPERTIES LABELS "unit;${ARG_LABELS}" TIMEOUT 120)
 endfunction()
 
 # brenvik_fuzz_target(<name> DEPENDS ...)

@@ -18,7 +18,8 @@ namespace brenvik {
 // lowest best-effort I/O priority.
 enum class QualityOfService { standard, utility };
 
-// A serial queue: tasks run one at a time, in the order posted. All members may be called from any thread.
+// A serial queue: tasks run one at a time, in the order posted. All members may be called from any thread that
+// keeps the queue alive meanwhile.
 // Destroying the last reference to a queue lets the task that runs finish, drops the tasks and timers that
 // have not started, and joins the queue's thread (unless it is destroyed on that very thread).
 class WorkQueue {

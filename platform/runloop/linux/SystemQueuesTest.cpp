@@ -149,7 +149,7 @@ TEST_F(SystemQueuesTest, UtilityQueueIsNicerThanTheRest) {
   EXPECT_EQ(ioPriority, (2 << 13) | 7);
 }
 
-TEST_F(SystemQueuesTest, DestroyingAQueueLetsTheRunningTaskFinishAndDropsTheRest) {
+TEST_F(SystemQueuesTest, DestroyingAQueueLetsTheRunningTaskFinishAndDropsWhatIsDelayed) {
   SystemQueues queues(*loop);
   auto queue = queues.makeSerial("short", QualityOfService::standard);
   std::promise<void> started;
@@ -160,10 +160,9 @@ TEST_F(SystemQueuesTest, DestroyingAQueueLetsTheRunningTaskFinishAndDropsTheRest
     goOn.get_future().wait();
     finished = true;
   });
+  queue->postAfter(1h, [] { ADD_FAILURE() << "dropped with the queue, and ran"; });
   started.get_future().wait();
-  queue->post([] { ADD_FAILURE() << "dropped with the queue, and ran"; });
   std::thread destroyer([&] { queue.reset(); });
-  // The destroyer cannot have ended before the task; give it the chance to get it wrong.
   goOn.set_value();
   destroyer.join();
   EXPECT_TRUE(finished);
@@ -171,15 +170,17 @@ TEST_F(SystemQueuesTest, DestroyingAQueueLetsTheRunningTaskFinishAndDropsTheRest
 
 TEST_F(SystemQueuesTest, AQueueMayBeDestroyedByItsOwnTask) {
   SystemQueues queues(*loop);
+  std::promise<void> posted;
   std::promise<void> destroyed;
-  {
-    auto holder = std::make_shared<std::shared_ptr<WorkQueue>>(queues.makeSerial("own", QualityOfService::standard));
-    auto& queue = **holder;
-    queue.post([holder, &destroyed] {
-      holder->reset();
-      destroyed.set_value();
-    });
-  }
+  auto queue = queues.makeSerial("own", QualityOfService::standard);
+  auto last = std::make_shared<std::shared_ptr<WorkQueue>>(queue);
+  queue->post([last, &posted, &destroyed] {
+    posted.get_future().wait();
+    last->reset();
+    destroyed.set_value();
+  });
+  queue.reset();
+  posted.set_value();
   destroyed.get_future().wait();
 }
 
