@@ -3,11 +3,19 @@
 #include "platform/baseband/linux/LoadedBasebandLibrary.h"
 
 #include <dlfcn.h>
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
+#include <cstddef>
+#include <cstring>
+#include <memory>
 #include <new>
 #include <type_traits>
 #include <utility>
 
+#include "platform/base/UniqueFd.h"
 #include "platform/baseband/linux/BasebandAbi.h"
 
 namespace brenvik {
@@ -21,6 +29,46 @@ template <typename Pointer>
 bool find(void* library, const char* name, Pointer* function) noexcept {
   *function = reinterpret_cast<Pointer>(::dlsym(library, name));
   return *function != nullptr;
+}
+
+// A failed dlopen costs some 90 system calls (170 us measured, at every start): the
+// loader tries every processor variant of every folder. The library is absent on most systems, so the same
+// places are looked into first, at a third of that: the loader's search path and its cache. A wrong "yes"
+// only costs the dlopen.
+bool isInSearchPath(const std::string& name) {
+  struct Closer {
+    void operator()(void* library) const noexcept { ::dlclose(library); }
+  };
+  const std::unique_ptr<void, Closer> program(::dlopen(nullptr, RTLD_NOW));
+  Dl_serinfo size{};
+  if (program == nullptr || ::dlinfo(program.get(), RTLD_DI_SERINFOSIZE, &size) != 0) return true;
+  const auto memory = std::make_unique<std::max_align_t[]>(size.dls_size / sizeof(std::max_align_t) + 1);
+  auto* const path = reinterpret_cast<Dl_serinfo*>(memory.get());
+  path->dls_size = size.dls_size;
+  path->dls_cnt = size.dls_cnt;
+  if (::dlinfo(program.get(), RTLD_DI_SERINFO, path) != 0) return true;
+  std::string candidate;
+  for (unsigned i = 0; i < path->dls_cnt; ++i) {
+    candidate.assign(path->dls_serpath[i].dls_name).append("/").append(name);
+    if (::access(candidate.c_str(), F_OK) == 0) return true;
+  }
+  return false;
+}
+
+bool isInLoaderCache(const std::string& name) noexcept {
+  const UniqueFd file(::open("/etc/ld.so.cache", O_RDONLY | O_CLOEXEC));
+  struct stat facts {};
+  if (!file.isValid() || ::fstat(file.get(), &facts) != 0 || facts.st_size <= 0) return false;
+  const auto size = static_cast<std::size_t>(facts.st_size);
+  void* const cache = ::mmap(nullptr, size, PROT_READ, MAP_PRIVATE, file.get(), 0);
+  if (cache == MAP_FAILED) return true;
+  const bool found = ::memmem(cache, size, name.c_str(), name.size() + 1) != nullptr;
+  ::munmap(cache, size);
+  return found;
+}
+
+bool isWorthLoading(const std::string& name) {
+  return name.find('/') != std::string::npos || isInSearchPath(name) || isInLoaderCache(name);
 }
 
 }  // namespace
@@ -52,10 +100,10 @@ LoadedBasebandLibrary::LoadedBasebandLibrary() : LoadedBasebandLibrary(BRENVIK_B
 
 LoadedBasebandLibrary::LoadedBasebandLibrary(std::string name) : name_(std::move(name)) {}
 
-bool LoadedBasebandLibrary::load() noexcept {
+bool LoadedBasebandLibrary::load() noexcept try {
   if (std::exchange(tried_, true)) return loaded_;
   // An empty name would open this program itself.
-  if (name_.empty()) return false;
+  if (name_.empty() || !isWorthLoading(name_)) return false;
   // Never closed: a library that has run threads or registered exit handlers cannot be unmapped safely.
   void* const library = ::dlopen(name_.c_str(), RTLD_NOW | RTLD_LOCAL);
   if (library == nullptr) return false;
@@ -72,6 +120,8 @@ bool LoadedBasebandLibrary::load() noexcept {
             find(library, "BrenvikBasebandServerStop", &functions_.stop) &&
             find(library, "BrenvikBasebandServerRelease", &functions_.release);
   return loaded_;
+} catch (const std::bad_alloc&) {
+  return false;
 }
 
 bool LoadedBasebandLibrary::canHost() noexcept { return load() && functions_.canHost() != 0; }

@@ -73,6 +73,20 @@ TEST(LoadedBasebandLibraryTest, TheLastReferenceReleasesTheServerEvenAfterTheLib
   EXPECT_EQ(inside.calls(), "cx");
 }
 
+TEST(LoadedBasebandLibraryTest, ALibraryIsFoundByItsNameInTheLoadersSearchPath) {
+  Inside inside(standin("whole"));
+  ASSERT_TRUE(inside.isOpen());
+  LoadedBasebandLibrary library("baseband_standin_whole.so");
+  EXPECT_TRUE(library.canHost());
+  EXPECT_EQ(inside.calls(), "?");
+}
+
+TEST(LoadedBasebandLibraryTest, ALibraryKnownToTheLoaderOnlyIsLoadedAndLacksTheFunctions) {
+  // The C library is found by its name but exports none of the functions.
+  LoadedBasebandLibrary library("libc.so.6");
+  EXPECT_FALSE(library.canHost());
+}
+
 TEST(LoadedBasebandLibraryTest, ALibraryThatSaysItCannotHostIsNotHosted) {
   LoadedBasebandLibrary library(standin("cannot_host"));
   EXPECT_FALSE(library.canHost());
