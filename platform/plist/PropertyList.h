@@ -4,7 +4,6 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <memory>
 #include <optional>
 #include <span>
 #include <string>
@@ -12,36 +11,54 @@
 #include <utility>
 #include <vector>
 
+#include "platform/plist/Node.h"
+
 namespace brenvik {
 
 // An immutable property-list value, or no value at all. Copies share what they hold; a value may be read
-// from any thread. Destroying the deepest or most shared value takes no recursion.
+// from any thread. Destroying the deepest or most shared value takes no recursion. Nothing here throws:
+// where memory runs out, there is no value.
+//
+// A value taken out of a parsed document keeps that document's memory alive as long as it lives.
 class PropertyList {
  public:
   enum class Type : std::uint8_t { boolean, integer, real, string, data, date, array, dictionary };
 
   PropertyList() = default;  // no value
+  PropertyList(const PropertyList& other) noexcept;
+  PropertyList(PropertyList&& other) noexcept
+      : node_(std::exchange(other.node_, {})), owner_(std::exchange(other.owner_, nullptr)) {}
+  PropertyList& operator=(const PropertyList& other) noexcept;
+  PropertyList& operator=(PropertyList&& other) noexcept;
+  ~PropertyList() {
+    if (owner_ != nullptr) letGo();
+  }
 
-  static PropertyList boolean(bool value);
-  static PropertyList integer(std::int64_t value);
-  static PropertyList unsignedInteger(std::uint64_t value);
-  static PropertyList real(double value);
-  static PropertyList string(std::string_view utf8);  // no value when it is not valid UTF-8
-  static PropertyList data(std::span<const std::byte> bytes);
-  static PropertyList date(double secondsSince2001);  // since 2001-01-01T00:00:00Z
-  static PropertyList array(std::vector<PropertyList> elements);  // absent elements are left out
-  // Keys in the order given; of equal keys the last value stands. Absent values are left out.
-  static PropertyList dictionary(std::vector<std::pair<std::string, PropertyList>> entries);
+  static PropertyList boolean(bool value) noexcept;
+  static PropertyList integer(std::int64_t value) noexcept;
+  static PropertyList unsignedInteger(std::uint64_t value) noexcept;
+  static PropertyList real(double value) noexcept;
+  static PropertyList string(std::string_view utf8) noexcept;  // no value when it is not valid UTF-8
+  static PropertyList data(std::span<const std::byte> bytes) noexcept;
+  static PropertyList date(double secondsSince2001) noexcept;              // since 2001-01-01T00:00:00Z
+  static PropertyList array(std::vector<PropertyList> elements) noexcept;  // absent elements are left out
+  // Keys in the order given; of equal keys the last value stands. Absent values are left out. No value when
+  // a key is not valid UTF-8.
+  static PropertyList dictionary(std::vector<std::pair<std::string, PropertyList>> entries) noexcept;
 
-  bool hasValue() const noexcept;
+  // A dictionary with the entry set (in its old place, or last) or, with an absent value, without it. Costs
+  // one pass over the entries. No value when this is not a dictionary or the key is not valid UTF-8.
+  PropertyList withEntry(std::string_view key, const PropertyList& value) const noexcept;
+
+  bool hasValue() const noexcept { return node_.tag != plist::Tag::none; }
   explicit operator bool() const noexcept { return hasValue(); }
   // Precondition: hasValue().
   Type type() const noexcept;
-  bool is(Type wanted) const noexcept;
+  bool is(Type wanted) const noexcept { return hasValue() && type() == wanted; }
 
   // Nothing when there is no value or it has another type. Views live as long as any copy of the value.
   std::optional<bool> asBoolean() const noexcept;
-  std::optional<std::int64_t> asInteger() const noexcept;  // nothing, too, above INT64_MAX
+  std::optional<std::int64_t> asInteger() const noexcept;           // nothing, too, above INT64_MAX
   std::optional<std::uint64_t> asUnsignedInteger() const noexcept;  // nothing, too, below 0
   std::optional<double> asReal() const noexcept;
   std::optional<std::string_view> asString() const noexcept;  // UTF-8, may hold NUL
@@ -49,16 +66,25 @@ class PropertyList {
   std::optional<double> asDate() const noexcept;
 
   // Of an array or a dictionary: the number of elements or entries; 0 for everything else.
-  std::size_t size() const noexcept;
+  std::size_t size() const noexcept { return node_.isContainer() ? node_.size : 0; }
   // Element of an array, value of a dictionary's entry, in order; no value when out of range.
   PropertyList at(std::size_t index) const noexcept;
   // Key of a dictionary's entry, in order; empty when out of range.
   std::string_view keyAt(std::size_t index) const noexcept;
-  // Value under the key of a dictionary; no value when absent or not a dictionary.
+  // Value under the key of a dictionary; no value when absent or not a dictionary. Constant time.
   PropertyList find(std::string_view key) const noexcept;
 
-  // Deep equality; dictionaries compare without regard to order.
-  bool operator==(const PropertyList& other) const;
+  // Deep equality, in time linear in what is stored however much of it is shared. Dictionaries compare
+  // without regard to order; a real that is not a number equals another one. False when memory runs out.
+  bool operator==(const PropertyList& other) const noexcept;
+
+ private:
+  friend struct plist::Access;
+
+  void letGo() noexcept;
+
+  plist::Node node_;
+  const plist::Document* owner_ = nullptr;  // null for what needs no memory: numbers, empty things
 };
 
 }  // namespace brenvik

@@ -12,8 +12,8 @@
 namespace brenvik {
 
 // Limits of every reader; a document beyond one of them is refused as malformed, in bounded time and memory.
-inline constexpr std::size_t kDeepestPropertyList = 512;                  // nesting levels
-inline constexpr std::size_t kLargestXmlForm = std::size_t{64} << 20;     // bytes a document may have as XML
+inline constexpr std::size_t kDeepestPropertyList = 512;               // nesting levels
+inline constexpr std::size_t kLargestXmlForm = std::size_t{64} << 20;  // bytes a document may have as XML
 
 enum class PropertyListFormat { xml, binary };
 
@@ -24,6 +24,7 @@ PropertyList parsePropertyList(std::span<const std::byte> bytes) noexcept;
 
 // The document as XML (version 1.0, with the usual document type) or in the binary version 00 format.
 // Nothing when there is no value, when it is beyond a limit or holds what the format cannot say.
-std::optional<std::string> serializePropertyList(const PropertyList& value, PropertyListFormat format) noexcept;
+std::optional<std::string> serializePropertyList(const PropertyList& value,
+                                                 PropertyListFormat format) noexcept;
 
 }  // namespace brenvik
