@@ -106,7 +106,6 @@ bool readReal(std::string_view text, Node& node) noexcept {
 }
 
 bool readDate(std::string_view text, Node& node) noexcept {
-  text = trimmed(text);
   constexpr std::string_view kForm = "0000-00-00T00:00:00Z";
   if (text.size() != kForm.size()) return false;
   for (std::size_t i = 0; i < kForm.size(); ++i) {

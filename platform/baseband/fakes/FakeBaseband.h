@@ -1,0 +1,50 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <string>
+
+#include "platform/baseband/HostedBasebandServer.h"
+
+namespace brenvik {
+
+// A baseband library that does as the test says and keeps a record of what was asked of it, in order.
+// Main thread only; it must outlive the servers it made.
+class FakeBasebandLibrary final : public BasebandLibrary {
+ public:
+  bool canHost() override {
+    record += "canHost ";
+    return hosts;
+  }
+  std::shared_ptr<HostedBasebandServer> create(std::shared_ptr<BasebandLogServer> logServer) override {
+    record += logServer == nullptr ? "create " : "createWithLogServer ";
+    if (!makesServer) return nullptr;
+    return std::make_shared<Server>(*this);
+  }
+
+  bool hosts = true;
+  bool makesServer = true;
+  bool busy = false;
+  int busyQuestions = 0;
+  std::string record;  // words, each followed by a blank
+
+ private:
+  class Server final : public HostedBasebandServer {
+   public:
+    explicit Server(FakeBasebandLibrary& library) : library_(library) {}
+    Server(const Server&) = delete;
+    Server& operator=(const Server&) = delete;
+    ~Server() override { library_.record += "release "; }
+    void start() override { library_.record += "start "; }
+    bool isBusy() override {
+      ++library_.busyQuestions;
+      return library_.busy;
+    }
+    void stop() override { library_.record += "stop "; }
+
+   private:
+    FakeBasebandLibrary& library_;
+  };
+};
+
+}  // namespace brenvik

@@ -1,0 +1,101 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/radio/linux/ModemManagerLogs.h"
+
+#include <systemd/sd-bus.h>
+
+#include <atomic>
+#include <chrono>
+#include <exception>
+#include <utility>
+
+namespace brenvik {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+// For everything: connecting, authenticating, the call and its answer.
+constexpr std::chrono::seconds kPatience{1};
+
+struct BusCloser {
+  // Without the flush that sd-bus offers: that could wait for a bus that does not read.
+  void operator()(sd_bus* bus) const noexcept { sd_bus_close_unref(bus); }
+};
+struct MessageUnref {
+  void operator()(sd_bus_message* message) const noexcept { sd_bus_message_unref(message); }
+};
+struct SlotUnref {
+  void operator()(sd_bus_slot* slot) const noexcept { sd_bus_slot_unref(slot); }
+};
+
+std::uint64_t microsecondsUntil(Clock::time_point deadline) noexcept {
+  const auto left = std::chrono::duration_cast<std::chrono::microseconds>(deadline - Clock::now());
+  return left.count() > 0 ? static_cast<std::uint64_t>(left.count()) : 0;
+}
+
+int takeAnswer(sd_bus_message*, void* answered, sd_bus_error*) {
+  *static_cast<bool*>(answered) = true;
+  return 1;
+}
+
+// A bus that is absent, refuses or keeps silent changes nothing for anybody, so every failure just ends it.
+void setLogging(const char* busAddress, const char* level) noexcept {
+  const auto deadline = Clock::now() + kPatience;
+  sd_bus* opened = nullptr;
+  if (sd_bus_new(&opened) < 0) return;
+  const std::unique_ptr<sd_bus, BusCloser> bus(opened);
+  if (sd_bus_set_address(opened, busAddress) < 0 || sd_bus_set_bus_client(opened, 1) < 0) return;
+  if (sd_bus_start(opened) < 0) return;
+
+  sd_bus_message* made = nullptr;
+  if (sd_bus_message_new_method_call(opened, &made, "org.freedesktop.ModemManager1",
+                                     "/org/freedesktop/ModemManager1", "org.freedesktop.ModemManager1",
+                                     "SetLogging") < 0) {
+    return;
+  }
+  const std::unique_ptr<sd_bus_message, MessageUnref> call(made);
+  if (sd_bus_message_append(made, "s", level) < 0 || sd_bus_message_set_auto_start(made, 0) < 0) return;
+
+  bool answered = false;
+  sd_bus_slot* asked = nullptr;
+  if (sd_bus_call_async(opened, &asked, made, takeAnswer, &answered, microsecondsUntil(deadline)) < 0) return;
+  const std::unique_ptr<sd_bus_slot, SlotUnref> slot(asked);
+  // The answer is waited for although it changes nothing: a sender that hangs up at once may not be heard.
+  while (!answered) {
+    const int handled = sd_bus_process(opened, nullptr);
+    if (handled < 0) return;
+    if (handled > 0) continue;
+    const std::uint64_t left = microsecondsUntil(deadline);
+    if (left == 0 || sd_bus_wait(opened, left) < 0) return;
+  }
+}
+
+}  // namespace
+
+struct ModemManagerLogs::Switch {
+  enum Position : int { unchanged, off, on };
+  const std::string busAddress;
+  std::atomic<Position> wanted{unchanged};
+};
+
+ModemManagerLogs::ModemManagerLogs(WorkQueues& queues, std::string busAddress)
+    : queues_(queues), switch_(new Switch{std::move(busAddress)}) {}
+
+ModemManagerLogs::~ModemManagerLogs() = default;
+
+void ModemManagerLogs::setLogToFile(bool enable) noexcept {
+  // Not one task a call: a client that switches all day must not leave a second of waiting behind each time.
+  if (switch_->wanted.exchange(enable ? Switch::on : Switch::off) != Switch::unchanged) return;
+  try {
+    if (queue_ == nullptr) queue_ = queues_.makeSerial("RadioManagerLogs", QualityOfService::utility);
+    queue_->post([state = switch_] {
+      const auto wanted = state->wanted.exchange(Switch::unchanged);
+      if (wanted == Switch::unchanged) return;
+      setLogging(state->busAddress.c_str(), wanted == Switch::on ? "DEBUG" : "INFO");
+    });
+  } catch (const std::exception&) {
+    switch_->wanted = Switch::unchanged;  // no memory or no thread: the next switch tries again
+  }
+}
+
+}  // namespace brenvik

@@ -1,0 +1,104 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/security/linux/CallerProcess.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <array>
+#include <charconv>
+
+namespace brenvik {
+namespace {
+
+// Longer than any path the kernel gives for a cgroup, times the hierarchies of an old system.
+constexpr std::size_t kLargestCgroupText = std::size_t{64} << 10;
+
+std::string_view takeLine(std::string_view* text) noexcept {
+  const std::size_t end = text->find('\n');
+  const std::string_view line = text->substr(0, end);
+  text->remove_prefix(end == std::string_view::npos ? text->size() : end + 1);
+  return line;
+}
+
+}  // namespace
+
+std::optional<ProcessFacts> parseProcessStat(std::string_view text) noexcept {
+  // The program's name, field 2, is in brackets, is the process's own choice and may hold brackets and
+  // blanks: count from its end.
+  const std::size_t nameEnd = text.rfind(')');
+  if (nameEnd == std::string_view::npos) return std::nullopt;
+  std::string_view rest = text.substr(nameEnd + 1);
+  ProcessFacts facts;
+  for (int field = 3; field <= 22; ++field) {
+    const std::size_t blank = rest.find(' ');
+    if (blank == std::string_view::npos) return std::nullopt;
+    rest.remove_prefix(blank + 1);
+    if (field == 3 && !rest.empty()) facts.state = rest.front();
+  }
+  std::uint64_t ticks = 0;
+  if (std::from_chars(rest.data(), rest.data() + rest.size(), ticks).ec != std::errc()) return std::nullopt;
+  facts.startTime = static_cast<std::uint32_t>(ticks);
+  return facts;
+}
+
+std::string_view unitOfCgroups(std::string_view text) noexcept {
+  std::string_view path;
+  while (!text.empty()) {
+    std::string_view line = takeLine(&text);
+    const std::size_t first = line.find(':');
+    const std::size_t second = first == std::string_view::npos ? first : line.find(':', first + 1);
+    if (second == std::string_view::npos) continue;
+    const std::string_view controllers = line.substr(first + 1, second - first - 1);
+    const bool unified = controllers.empty() && line.substr(0, first) == "0";
+    if (!unified && controllers != "name=systemd") continue;
+    path = line.substr(second + 1);
+    if (unified) break;
+  }
+  const std::size_t slash = path.rfind('/');
+  return slash == std::string_view::npos ? std::string_view() : path.substr(slash + 1);
+}
+
+std::optional<CallerProcess> CallerProcess::pin(const std::string& proc, pid_t pid, std::uint32_t startTime) {
+  if (pid <= 0) return std::nullopt;
+  const std::string path = proc + '/' + std::to_string(pid);
+  CallerProcess process(UniqueFd(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC)), startTime);
+  if (!process.folder_.isValid() || !process.isStillRunning()) return std::nullopt;
+  return process;
+}
+
+bool CallerProcess::isStillRunning() const noexcept {
+  const UniqueFd file(::openat(folder_.get(), "stat", O_RDONLY | O_CLOEXEC));
+  if (!file.isValid()) return false;
+  std::array<char, 1024> text;
+  const ssize_t size = ::read(file.get(), text.data(), text.size());
+  if (size <= 0) return false;
+  const auto facts = parseProcessStat({text.data(), static_cast<std::size_t>(size)});
+  return facts && facts->startTime == startTime_ && facts->state != 'Z' && facts->state != 'X';
+}
+
+std::optional<CallerProcess::FileIdentity> CallerProcess::executable() const noexcept {
+  struct stat facts {};
+  if (::fstatat(folder_.get(), "exe", &facts, 0) != 0) return std::nullopt;
+  return FileIdentity{facts.st_dev, facts.st_ino};
+}
+
+UniqueFd CallerProcess::openExecutable() const noexcept {
+  return UniqueFd(::openat(folder_.get(), "exe", O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+}
+
+std::string CallerProcess::unit() const {
+  const UniqueFd file(::openat(folder_.get(), "cgroup", O_RDONLY | O_CLOEXEC));
+  if (!file.isValid()) return {};
+  std::string text;
+  std::array<char, 1024> part;
+  for (;;) {
+    const ssize_t size = ::read(file.get(), part.data(), part.size());
+    if (size < 0 || text.size() > kLargestCgroupText) return {};
+    if (size == 0) return std::string(unitOfCgroups(text));
+    text.append(part.data(), static_cast<std::size_t>(size));
+  }
+}
+
+}  // namespace brenvik

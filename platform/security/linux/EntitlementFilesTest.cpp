@@ -1,0 +1,757 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/security/linux/EntitlementFiles.h"
+
+#include <dlfcn.h>
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <array>
+#include <csignal>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "platform/accounts/fakes/FakeAccountDirectory.h"
+#include "platform/base/ProcessStartTime.h"
+#include "platform/base/UniqueFd.h"
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/plist/PropertyListCodec.h"
+#include "platform/security/linux/Sha256.h"
+
+namespace brenvik {
+namespace {
+
+namespace fs = std::filesystem;
+using testing::ElementsAre;
+using testing::IsEmpty;
+
+constexpr const char* kName = "com.example.allow";
+constexpr uid_t kStranger = 65534;
+
+std::string quoted(const std::string& key, const std::string& text) {
+  return "<key>" + key + "</key><string>" + text + "</string>";
+}
+std::string held(const std::string& value = "<true/>") {
+  return std::string("<key>Entitlements</key><dict><key>") + kName + "</key>" + value + "</dict>";
+}
+std::string document(const std::string& keys) {
+  return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>" + keys +
+         "</dict></plist>\n";
+}
+
+std::string hexOf(std::uint8_t byte) {
+  std::array<char, 3> two;
+  std::snprintf(two.data(), two.size(), "%02x", byte);
+  return two.data();
+}
+
+// A process that runs `program` as root until this object goes, or kill() is called.
+class Child {
+ public:
+  explicit Child(const std::string& program) {
+    int input[2];
+    int started[2];
+    if (::pipe2(input, O_CLOEXEC) != 0 || ::pipe2(started, O_CLOEXEC) != 0) std::abort();
+    keepsItWaiting_.reset(input[1]);
+    const UniqueFd itsInput(input[0]);
+    const UniqueFd hasStarted(started[0]);
+    UniqueFd untilExec(started[1]);
+    pid_ = ::fork();
+    if (pid_ == 0) {
+      ::dup2(itsInput.get(), 0);
+      ::execl(program.c_str(), "caller", nullptr);
+      ::_exit(127);
+    }
+    untilExec.reset();
+    char byte;
+    (void)!::read(hasStarted.get(), &byte, 1);  // end of file once exec has closed the other end
+    startTime_ = processStartTime(pid_).value_or(0);
+  }
+  Child(const Child&) = delete;
+  Child& operator=(const Child&) = delete;
+  ~Child() { kill(); }
+
+  void kill() {
+    if (pid_ <= 0) return;
+    ::kill(pid_, SIGKILL);
+    ::waitpid(pid_, nullptr, 0);
+    pid_ = -1;
+  }
+  AuditToken token(uid_t uid = 0) const {
+    AuditToken token;
+    token.words = {~0U, uid, uid, uid, uid, static_cast<std::uint32_t>(pid_), 1, startTime_};
+    return token;
+  }
+
+ private:
+  UniqueFd keepsItWaiting_;
+  pid_t pid_ = -1;
+  std::uint32_t startTime_ = 0;
+};
+
+class EntitlementFilesTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    if (::geteuid() != 0) GTEST_SKIP() << "files owned by root are made by root";
+    std::string name = (fs::temp_directory_path() / "entitlements-XXXXXX").string();
+    root = ::mkdtemp(name.data());
+    // Umask and a link in the path of the temporary folder are not what is tested.
+    root = fs::canonical(root);
+    for (const char* const folder : {"etc", "lib"}) {
+      fs::create_directory(root / folder);
+      ASSERT_EQ(::chmod((root / folder).c_str(), 0755), 0);
+    }
+    program = (root / "program").string();
+    fs::copy_file("/bin/cat", program);
+    ASSERT_EQ(::chmod(program.c_str(), 0755), 0);
+  }
+  void TearDown() override {
+    if (!root.empty()) fs::remove_all(root);
+  }
+
+  fs::path write(const char* name, const std::string& content) {
+    const fs::path path = root / name;
+    std::ofstream(path, std::ios::binary) << content;
+    EXPECT_EQ(::chmod(path.c_str(), 0644), 0);
+    return path;
+  }
+  fs::path grant(const char* name, const std::string& value = "<true/>", const std::string& more = "") {
+    return write(name, document(quoted("Executable", program) + more + held(value)));
+  }
+
+  EntitlementFiles makeFiles(const std::string& proc = "/proc") {
+    return EntitlementFiles(accounts, {(root / "etc").string(), (root / "lib").string()}, proc);
+  }
+  SecurityTask::Answer ask(const AuditToken& caller, const char* name = kName) {
+    auto files = makeFiles();
+    const auto task = files.makeTask(caller);
+    if (task == nullptr) {
+      ADD_FAILURE() << "no task";
+      return {};
+    }
+    return task->copyEntitlement(name);
+  }
+  // The caller holds nothing, and nobody is to blame.
+  void expectNothing(const AuditToken& caller, const char* why = "") {
+    const auto answer = ask(caller);
+    EXPECT_FALSE(answer.value) << why;
+    EXPECT_FALSE(answer.error) << why;
+  }
+  void expectGranted(const AuditToken& caller, const char* why = "") {
+    const auto answer = ask(caller);
+    EXPECT_EQ(answer.value, PropertyList::boolean(true)) << why;
+    EXPECT_FALSE(answer.error) << why;
+  }
+  std::string line(const char* before, const fs::path& path, const char* after) {
+    return before + path.string() + after;
+  }
+  void expectOneError(const std::string& text) {
+    EXPECT_THAT(log.entries(), ElementsAre(RecordingLog::unifiedLine(LogLevel::error, text)));
+    log.clear();
+  }
+
+  fs::path root;
+  std::string program;
+  FakeAccountDirectory accounts;
+  RecordingLog log;
+};
+
+TEST_F(EntitlementFilesTest, AFileOfTheCallersProgramGivesTheValue) {
+  grant("etc/a.plist");
+  const Child caller(program);
+  expectGranted(caller.token());
+  EXPECT_THAT(log.entries(), IsEmpty());
+  EXPECT_EQ(accounts.idLookUps, 0) << "the superuser needs no look-up";
+}
+
+TEST_F(EntitlementFilesTest, ValuesOfAnyTypeAreGivenAsTheyAre) {
+  grant("etc/a.plist", "<string>true</string>");
+  const Child caller(program);
+  EXPECT_EQ(ask(caller.token()).value, PropertyList::string("true"));
+  grant("etc/a.plist", "<false/>");
+  EXPECT_EQ(ask(caller.token()).value, PropertyList::boolean(false));
+  grant("etc/a.plist", "<array><integer>7</integer></array>");
+  EXPECT_EQ(ask(caller.token()).value, PropertyList::array({PropertyList::integer(7)}));
+}
+
+TEST_F(EntitlementFilesTest, AnEntitlementThatNoFileNamesHasNoValue) {
+  grant("etc/a.plist");
+  const Child caller(program);
+  const auto answer = ask(caller.token(), "com.example.other");
+  EXPECT_FALSE(answer.value);
+  EXPECT_FALSE(answer.error);
+}
+
+TEST_F(EntitlementFilesTest, WithoutDirectoriesNobodyHoldsAnythingAndNothingIsSaid) {
+  fs::remove(root / "etc");
+  fs::remove(root / "lib");
+  const Child caller(program);
+  expectNothing(caller.token());
+  EXPECT_THAT(log.entries(), IsEmpty());
+}
+
+TEST_F(EntitlementFilesTest, AnotherProgramIsNotMatched) {
+  grant("etc/a.plist");
+  fs::copy_file(program, root / "copy");
+  const Child caller((root / "copy").string());
+  expectNothing(caller.token(), "the same bytes in another file");
+}
+
+TEST_F(EntitlementFilesTest, TheExecutableIsFollowedThroughLinks) {
+  fs::create_symlink(program, root / "link");
+  write("etc/a.plist", document(quoted("Executable", (root / "link").string()) + held()));
+  const Child caller(program);
+  expectGranted(caller.token());
+}
+
+TEST_F(EntitlementFilesTest, AProgramReplacedUnderTheRunningCallerIsAnotherProgram) {
+  grant("etc/a.plist");
+  const Child caller(program);
+  fs::copy_file(program, root / "new");
+  fs::rename(root / "new", program);
+  expectNothing(caller.token());
+}
+
+TEST_F(EntitlementFilesTest, AnExecutableThatIsNoAbsolutePathOrDoesNotExistMatchesNothing) {
+  const Child caller(program);
+  write("etc/a.plist", document(quoted("Executable", "program") + held()));
+  expectNothing(caller.token(), "relative");
+  write("etc/a.plist", document(quoted("Executable", (root / "gone").string()) + held()));
+  expectNothing(caller.token(), "missing");
+  write("etc/a.plist", document(held()));
+  expectNothing(caller.token(), "not named");
+  EXPECT_THAT(log.entries(), IsEmpty());
+}
+
+TEST_F(EntitlementFilesTest, TheAccountOfTheMessageDecidesAndRootIsTheDefault) {
+  grant("etc/a.plist");
+  const Child caller(program);
+  expectNothing(caller.token(kStranger), "a program of root's that sent the message as somebody else");
+  expectGranted(caller.token());
+}
+
+TEST_F(EntitlementFilesTest, ANamedAccountIsLookedUpAndCompared) {
+  accounts.accounts["keeper"] = {AccountIds{kStranger, 1}, std::nullopt};
+  grant("etc/a.plist", "<true/>", quoted("User", "keeper"));
+  const Child caller(program);
+  expectGranted(caller.token(kStranger));
+  expectNothing(caller.token(0), "root is not keeper");
+  accounts.accounts.clear();
+  expectNothing(caller.token(kStranger), "no such account");
+}
+
+TEST_F(EntitlementFilesTest, TheAccountComesFirstSoThatNothingOfAStrangerIsLookedAt) {
+  grant("etc/a.plist");
+  ASSERT_EQ(::chmod(program.c_str(), 0777), 0);
+  const Child caller(program);
+  expectNothing(caller.token(kStranger));
+  EXPECT_THAT(log.entries(), IsEmpty()) << "its executable would have been complained about";
+}
+
+TEST_F(EntitlementFilesTest, FilesAreReadInBytewiseOrderOfTheirNames) {
+  grant("etc/a.plist", "<string>a</string>");
+  grant("etc/Z.plist", "<string>Z</string>");
+  grant("etc/10.plist", "<string>10</string>");
+  grant("etc/9.plist", "<string>9</string>");
+  grant("etc/\xC3\xA9.plist", "<string>e-acute</string>");
+  const Child caller(program);
+  for (const char* const first : {"10", "9", "Z", "a"}) {
+    EXPECT_EQ(ask(caller.token()).value, PropertyList::string(first));
+    fs::remove(root / "etc" / (std::string(first) + ".plist"));
+  }
+  EXPECT_EQ(ask(caller.token()).value, PropertyList::string("e-acute"));
+}
+
+TEST_F(EntitlementFilesTest, TheFirstDirectoryGoesBeforeTheSecondWhateverTheNames) {
+  grant("etc/z.plist", "<false/>");
+  grant("lib/a.plist", "<true/>");
+  const Child caller(program);
+  EXPECT_EQ(ask(caller.token()).value, PropertyList::boolean(false)) << "the administrator's word stands";
+  fs::remove(root / "etc/z.plist");
+  expectGranted(caller.token());
+}
+
+TEST_F(EntitlementFilesTest, AFileThatMatchesWithoutTheKeyLeavesTheQuestionToTheNext) {
+  write("etc/a.plist", document(quoted("Executable", program) + "<key>Entitlements</key><dict/>"));
+  grant("etc/b.plist");
+  const Child caller(program);
+  expectGranted(caller.token());
+}
+
+TEST_F(EntitlementFilesTest, OnlyNamesThatEndInPlistAndAreNotHiddenAreRead) {
+  grant("etc/a.plist.bak");
+  grant("etc/a.PLIST");
+  grant("etc/aplist");
+  grant("etc/.a.plist");
+  grant("etc/.plist");
+  const Child caller(program);
+  expectNothing(caller.token());
+  EXPECT_THAT(log.entries(), IsEmpty());
+}
+
+TEST_F(EntitlementFilesTest, BinaryFilesAreReadToo) {
+  const auto content = PropertyList::dictionary(
+      {{"Executable", PropertyList::string(program)},
+       {"Entitlements", PropertyList::dictionary({{kName, PropertyList::boolean(true)}})}});
+  const auto bytes = serializePropertyList(content, PropertyListFormat::binary);
+  ASSERT_TRUE(bytes);
+  write("etc/a.plist", *bytes);
+  const Child caller(program);
+  expectGranted(caller.token());
+}
+
+TEST_F(EntitlementFilesTest, ATextWithANulInItNamesNoFileAndNoAccount) {
+  const std::string nul(1, '\0');
+  const auto writeWith = [&](const std::string& executable, const std::string& user) {
+    const auto bytes = serializePropertyList(
+        PropertyList::dictionary(
+            {{"Executable", PropertyList::string(executable)},
+             {"User", PropertyList::string(user)},
+             {"Entitlements", PropertyList::dictionary({{kName, PropertyList::boolean(true)}})}}),
+        PropertyListFormat::binary);
+    ASSERT_TRUE(bytes);
+    write("etc/a.plist", *bytes);
+  };
+  accounts.accounts["keeper"] = {AccountIds{0, 0}, std::nullopt};
+  const Child caller(program);
+  writeWith(program, "keeper");
+  expectGranted(caller.token());
+  writeWith(program + nul + "x", "keeper");
+  expectNothing(caller.token());
+  writeWith(program, "keeper" + nul + "x");
+  expectNothing(caller.token());
+}
+
+struct WrongType {
+  const char* name;
+  const char* keys;  // after Executable and Entitlements
+};
+class WrongTypeTest : public EntitlementFilesTest, public testing::WithParamInterface<WrongType> {};
+
+TEST_P(WrongTypeTest, AKeyOfTheWrongTypeMakesTheFileNoMatch) {
+  write("etc/a.plist", document(quoted("Executable", program) + held() + GetParam().keys));
+  const Child caller(program);
+  expectNothing(caller.token());
+  EXPECT_THAT(log.entries(), IsEmpty());
+  grant("etc/b.plist");
+  expectGranted(caller.token(), "the next file is asked");
+}
+INSTANTIATE_TEST_SUITE_P(EveryKey, WrongTypeTest,
+                         testing::Values(WrongType{"Executable", "<key>Executable</key><integer>1</integer>"},
+                                         WrongType{"User", "<key>User</key><integer>0</integer>"},
+                                         WrongType{"Unit", "<key>Unit</key><array/>"},
+                                         WrongType{"SHA256", "<key>SHA256</key><data></data>"},
+                                         WrongType{"Entitlements", "<key>Entitlements</key><array/>"}),
+                         [](const auto& test) { return std::string(test.param.name); });
+
+TEST_F(EntitlementFilesTest, TheDigestMustMatchWhenItIsGiven) {
+  const UniqueFd fd(::open(program.c_str(), O_RDONLY | O_CLOEXEC));
+  const auto digest = sha256OfFile(fd.get());
+  ASSERT_TRUE(digest);
+  std::string hex;
+  for (const std::uint8_t byte : *digest) hex += hexOf(byte);
+  const Child caller(program);
+  grant("etc/a.plist", "<true/>", quoted("SHA256", hex));
+  expectGranted(caller.token());
+  for (char& c : hex) c = static_cast<char>(std::toupper(c));
+  grant("etc/a.plist", "<true/>", quoted("SHA256", hex));
+  expectGranted(caller.token(), "upper case");
+  hex.back() = hex.back() == '0' ? '1' : '0';
+  grant("etc/a.plist", "<true/>", quoted("SHA256", hex));
+  expectNothing(caller.token(), "another digest");
+  hex.pop_back();
+  grant("etc/a.plist", "<true/>", quoted("SHA256", hex));
+  expectNothing(caller.token(), "no digest at all");
+  grant("etc/a.plist", "<true/>", quoted("SHA256", ""));
+  expectNothing(caller.token(), "empty");
+}
+
+using EntitlementFilesDeathTest = EntitlementFilesTest;
+
+TEST_F(EntitlementFilesDeathTest, TheDigestLibraryIsLoadedByTheFirstFileThatNeedsItAndNotBefore) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");  // a process of its own, in which no other test has run
+  EXPECT_EXIT(
+      {
+        const auto isLoaded = [] { return ::dlopen("libcrypto.so.3", RTLD_NOW | RTLD_NOLOAD) != nullptr; };
+        const Child caller(program);
+        const bool atStart = isLoaded();
+        grant("etc/a.plist");
+        const bool granted = ask(caller.token()).value.hasValue();
+        const bool withoutDigest = isLoaded();
+        grant("etc/a.plist", "<true/>", quoted("SHA256", std::string(64, '0')));
+        (void)ask(caller.token(kStranger));
+        const bool forAStranger = isLoaded();
+        (void)ask(caller.token());
+        const bool withDigest = isLoaded();
+        fs::remove_all(root);
+        ::_exit(!atStart && granted && !withoutDigest && !forAStranger && withDigest ? 7 : 1);
+      },
+      testing::ExitedWithCode(7), "");
+}
+
+// ----- What cannot be trusted -----
+
+TEST_F(EntitlementFilesTest, AFileNotOwnedByRootIsPassedOverAndReported) {
+  const auto file = grant("etc/a.plist");
+  ASSERT_EQ(::chown(file.c_str(), kStranger, 0), 0);
+  const Child caller(program);
+  expectNothing(caller.token());
+  expectOneError(
+      line("entitlement file ", file, " passed over: not owned by root, or others may write to it"));
+  grant("lib/a.plist");
+  expectGranted(caller.token(), "the next file is asked");
+}
+
+TEST_F(EntitlementFilesTest, AFileThatGroupOrOthersMayWriteIsPassedOverAndReported) {
+  const auto file = grant("etc/a.plist");
+  const Child caller(program);
+  for (const mode_t mode : {0664U, 0646U, 0666U}) {
+    ASSERT_EQ(::chmod(file.c_str(), mode), 0);
+    expectNothing(caller.token());
+    expectOneError(
+        line("entitlement file ", file, " passed over: not owned by root, or others may write to it"));
+  }
+}
+
+TEST_F(EntitlementFilesTest, ADirectoryThatCannotBeTrustedIsPassedOverAndReported) {
+  grant("etc/a.plist");
+  const Child caller(program);
+  const fs::path etc = root / "etc";
+  const std::string text =
+      line("entitlement directory ", etc, " passed over: not owned by root, or others may write to it");
+  for (const mode_t mode : {0775U, 0757U, 01777U}) {
+    ASSERT_EQ(::chmod(etc.c_str(), mode), 0);
+    expectNothing(caller.token());
+    expectOneError(text);
+  }
+  ASSERT_EQ(::chmod(etc.c_str(), 0755), 0);
+  ASSERT_EQ(::chown(etc.c_str(), kStranger, 0), 0);
+  expectNothing(caller.token());
+  expectOneError(text);
+  ASSERT_EQ(::chown(etc.c_str(), 0, 0), 0);
+  expectGranted(caller.token());
+}
+
+TEST_F(EntitlementFilesTest, ADirectoryThatIsNoneIsPassedOverAndReported) {
+  fs::remove(root / "etc");
+  write("etc", "");
+  grant("lib/a.plist");
+  const Child caller(program);
+  expectGranted(caller.token());
+  expectOneError(line("entitlement directory ", root / "etc", " passed over: not a directory"));
+}
+
+TEST_F(EntitlementFilesTest, AnExecutableThatCannotBeTrustedMakesItsFilePassedOverAndReported) {
+  const auto file = grant("etc/a.plist");
+  const std::string text =
+      line("entitlement file ", file,
+           " passed over: its executable is not owned by root, or others may write to it");
+  const Child caller(program);
+  for (const mode_t mode : {0775U, 0757U}) {
+    ASSERT_EQ(::chmod(program.c_str(), mode), 0);
+    expectNothing(caller.token());
+    expectOneError(text);
+  }
+  ASSERT_EQ(::chmod(program.c_str(), 0755), 0);
+  ASSERT_EQ(::chown(program.c_str(), kStranger, 0), 0);
+  expectNothing(caller.token());
+  expectOneError(text);
+}
+
+TEST_F(EntitlementFilesTest, ALinkIsPassedOverAndReported) {
+  const auto target = grant("good");
+  fs::create_symlink(target, root / "etc/a.plist");
+  const Child caller(program);
+  expectNothing(caller.token());
+  expectOneError(line("entitlement file ", root / "etc/a.plist", " passed over: not a regular file"));
+}
+
+TEST_F(EntitlementFilesTest, APipeASocketADeviceAndAFolderArePassedOverReportedAndHoldNobodyUp) {
+  const Child caller(program);
+  const fs::path file = root / "etc/a.plist";
+  const std::string text = line("entitlement file ", file, " passed over: not a regular file");
+
+  ASSERT_EQ(::mkfifo(file.c_str(), 0644), 0);
+  expectNothing(caller.token(), "pipe");
+  expectOneError(text);
+  fs::remove(file);
+
+  const UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  ASSERT_LT(file.string().size(), sizeof address.sun_path);
+  file.string().copy(address.sun_path, file.string().size());
+  ASSERT_EQ(::bind(socket.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  expectNothing(caller.token(), "socket");
+  expectOneError(text);
+  fs::remove(file);
+
+  fs::create_directory(file);
+  expectNothing(caller.token(), "folder");
+  expectOneError(text);
+}
+
+TEST_F(EntitlementFilesTest, AFileOfOneMebibyteIsReadAndALargerOneIsPassedOverAndReported) {
+  const std::string good = document(quoted("Executable", program) + held());
+  const auto file = write("etc/a.plist", good + std::string((std::size_t{1} << 20) - good.size(), '\n'));
+  ASSERT_EQ(fs::file_size(file), std::size_t{1} << 20);
+  const Child caller(program);
+  expectGranted(caller.token());
+  write("etc/a.plist", good + std::string((std::size_t{1} << 20) - good.size() + 1, '\n'));
+  expectNothing(caller.token());
+  expectOneError(line("entitlement file ", file, " passed over: too large"));
+}
+
+TEST_F(EntitlementFilesTest, AFileThatIsNoPropertyListDictionaryIsPassedOverAndReported) {
+  const Child caller(program);
+  const std::string text =
+      line("entitlement file ", root / "etc/a.plist", " passed over: not a property list of the right form");
+  for (const char* const content :
+       {"", "hello", "<plist version=\"1.0\"><dict>", "<plist version=\"1.0\"><array/></plist>"}) {
+    write("etc/a.plist", content);
+    expectNothing(caller.token(), content);
+    expectOneError(text);
+  }
+}
+
+// ----- Who is asking -----
+
+TEST_F(EntitlementFilesTest, ACallerThatIsGoneOrAwaitsItsParentOrIsAnotherOneIsNoTask) {
+  grant("etc/a.plist");
+  auto files = makeFiles();
+  Child caller(program);
+  AuditToken token = caller.token();
+  EXPECT_NE(files.makeTask(token), nullptr);
+
+  token.words[7] += 1;
+  EXPECT_EQ(files.makeTask(token), nullptr) << "the id now belongs to a process that started at another time";
+
+  token = caller.token();
+  caller.kill();
+  EXPECT_EQ(files.makeTask(token), nullptr) << "gone";
+
+  token.words[5] = 0;
+  EXPECT_EQ(files.makeTask(token), nullptr) << "a token that names no process";
+}
+
+TEST_F(EntitlementFilesTest, ACallerThatGoesAfterTheTaskWasMadeHoldsNothing) {
+  grant("etc/a.plist");
+  auto files = makeFiles();
+  Child caller(program);
+  const auto task = files.makeTask(caller.token());
+  ASSERT_NE(task, nullptr);
+  caller.kill();
+  const auto answer = task->copyEntitlement(kName);
+  EXPECT_FALSE(answer.value);
+  EXPECT_FALSE(answer.error);
+}
+
+TEST_F(EntitlementFilesTest, ACallerThatGoesWhileTheFilesAreReadHoldsNothing) {
+  // The first file makes the caller's program known; the second asks for an account, and while that is looked
+  // up the caller goes. By then everything fits: only the look at the end can tell.
+  write("etc/a.plist", document(quoted("Executable", program) + "<key>Entitlements</key><dict/>"));
+  grant("etc/b.plist", "<true/>", quoted("User", "keeper"));
+  accounts.accounts["keeper"] = {AccountIds{0, 0}, std::nullopt};
+  auto files = makeFiles();
+  Child caller(program);
+  {
+    const auto task = files.makeTask(caller.token());
+    ASSERT_NE(task, nullptr);
+    ASSERT_TRUE(task->copyEntitlement(kName).value) << "it would be granted";
+  }
+  const auto task = files.makeTask(caller.token());
+  ASSERT_NE(task, nullptr);
+  accounts.whenAskedForIds = [&](const std::string&) { caller.kill(); };
+  const auto answer = task->copyEntitlement(kName);
+  EXPECT_FALSE(answer.value);
+  EXPECT_FALSE(answer.error);
+  EXPECT_EQ(accounts.idLookUps, 2);
+}
+
+// A made-up /proc with one process, for what a real one cannot be brought to do.
+class MadeUpProcessTest : public EntitlementFilesTest {
+ protected:
+  void SetUp() override {
+    EntitlementFilesTest::SetUp();
+    if (IsSkipped()) return;
+    fs::create_directories(root / "proc/7");
+    write("proc/7/stat", statText('S', 100));
+    write("proc/7/cgroup", "0::/system.slice/caller.service\n");
+    fs::create_symlink(program, root / "proc/7/exe");
+    token.words = {~0U, 0, 0, 0, 0, 7, 1, 100};
+  }
+  static std::string statText(char state, int startTime) {
+    return std::string("7 (a b) c) ") + state + " 1 7 7 0 -1 0 0 0 0 0 0 0 0 0 20 0 1 0 " +
+           std::to_string(startTime) + " 0\n";
+  }
+  SecurityTask::Answer askHere() {
+    auto files = makeFiles((root / "proc").string());
+    const auto task = files.makeTask(token);
+    if (task == nullptr) {
+      ADD_FAILURE() << "no task";
+      return {};
+    }
+    return task->copyEntitlement(kName);
+  }
+  AuditToken token;
+};
+
+TEST_F(MadeUpProcessTest, TheUnitMustBeTheOneTheCallerRunsIn) {
+  grant("etc/a.plist", "<true/>", quoted("Unit", "caller.service"));
+  EXPECT_TRUE(askHere().value);
+  for (const char* const other :
+       {"other.service", "caller", "system.slice", "/system.slice/caller.service", ""}) {
+    grant("etc/a.plist", "<true/>", quoted("Unit", other));
+    EXPECT_FALSE(askHere().value) << other;
+  }
+}
+
+TEST_F(MadeUpProcessTest, AUnitIsFoundInTheHierarchyNamedSystemdWhereThereIsNoUnifiedOne) {
+  write("proc/7/cgroup", "4:cpu:/\n1:name=systemd:/system.slice/caller.service\n");
+  grant("etc/a.plist", "<true/>", quoted("Unit", "caller.service"));
+  EXPECT_TRUE(askHere().value);
+}
+
+TEST_F(MadeUpProcessTest, AnEmptyUnitIsNotTheUnitOfACallerThatIsInNone) {
+  write("proc/7/cgroup", "0::/\n");
+  grant("etc/a.plist", "<true/>", quoted("Unit", ""));
+  EXPECT_FALSE(askHere().value);
+  fs::remove(root / "proc/7/cgroup");
+  EXPECT_FALSE(askHere().value);
+}
+
+TEST_F(MadeUpProcessTest, AProcessThatTookTheIdOverWhileTheFilesWereReadHoldsNothing) {
+  grant("etc/a.plist", "<true/>", quoted("User", "keeper"));
+  accounts.accounts["keeper"] = {AccountIds{0, 0}, std::nullopt};
+  EXPECT_TRUE(askHere().value);
+  accounts.whenAskedForIds = [&](const std::string&) { write("proc/7/stat", statText('S', 101)); };
+  const auto answer = askHere();
+  EXPECT_FALSE(answer.value);
+  EXPECT_FALSE(answer.error);
+}
+
+TEST_F(MadeUpProcessTest, AProcessThatExitedWhileTheFilesWereReadHoldsNothing) {
+  grant("etc/a.plist", "<true/>", quoted("User", "keeper"));
+  accounts.accounts["keeper"] = {AccountIds{0, 0}, std::nullopt};
+  accounts.whenAskedForIds = [&](const std::string&) { write("proc/7/stat", statText('Z', 100)); };
+  EXPECT_FALSE(askHere().value);
+}
+
+TEST_F(MadeUpProcessTest, AProgramThatBecomesAnotherOneBeforeItIsDigestedIsNoMatch) {
+  // The first file makes the caller's program known; while the account of the second is looked up the caller
+  // becomes another program, and that one's digest is what the file asks for.
+  write("other", "another program");
+  const UniqueFd other(::open((root / "other").c_str(), O_RDONLY | O_CLOEXEC));
+  std::string hex;
+  const Sha256Digest digest = sha256OfFile(other.get()).value();
+  for (const std::uint8_t byte : digest) hex += hexOf(byte);
+  write("etc/a.plist", document(quoted("Executable", program) + "<key>Entitlements</key><dict/>"));
+  grant("etc/b.plist", "<true/>", quoted("User", "keeper") + quoted("SHA256", hex));
+  accounts.accounts["keeper"] = {AccountIds{0, 0}, std::nullopt};
+  accounts.whenAskedForIds = [&](const std::string&) {
+    fs::remove(root / "proc/7/exe");
+    fs::create_symlink(root / "other", root / "proc/7/exe");
+  };
+  const auto answer = askHere();
+  EXPECT_EQ(accounts.idLookUps, 1);
+  EXPECT_FALSE(answer.value);
+  EXPECT_FALSE(answer.error);
+}
+
+// ----- When the system fails us -----
+
+TEST_F(EntitlementFilesTest, OutOfDescriptorsTheQuestionCannotBeAnsweredAndALaterFileDoesNotAnswerInstead) {
+  grant("etc/a.plist", "<false/>");
+  grant("lib/a.plist", "<true/>");
+  auto files = makeFiles();
+  const Child caller(program);
+  const auto task = files.makeTask(caller.token());
+  ASSERT_NE(task, nullptr);
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+  const auto limitTo = [&](int descriptors) {
+    const rlimit limit{static_cast<rlim_t>(descriptors), before.rlim_max};
+    ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &limit), 0);
+  };
+  int next = ::dup(0);
+  ASSERT_GE(next, 0);
+  ::close(next);
+
+  limitTo(next);  // not even the directory
+  auto answer = task->copyEntitlement(kName);
+  limitTo(next + 1);  // the directory, but not the file
+  const auto second = task->copyEntitlement(kName);
+  limitTo(next);
+  const auto noTask = files.makeTask(caller.token());
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
+
+  EXPECT_TRUE(answer.error);
+  EXPECT_FALSE(answer.value);
+  EXPECT_TRUE(second.error);
+  EXPECT_FALSE(second.value);
+  EXPECT_EQ(noTask, nullptr);
+  EXPECT_THAT(
+      log.entries(),
+      ElementsAre(
+          RecordingLog::unifiedLine(
+              LogLevel::error, line("entitlements cannot be told: ", root / "etc", " cannot be examined")),
+          RecordingLog::unifiedLine(LogLevel::error, line("entitlements cannot be told: ",
+                                                          root / "etc/a.plist", " cannot be examined"))));
+  answer = task->copyEntitlement(kName);
+  EXPECT_EQ(answer.value, PropertyList::boolean(false));
+  EXPECT_FALSE(answer.error);
+}
+
+TEST_F(EntitlementFilesTest, NoDescriptorIsLeftBehind) {
+  grant("etc/a.plist", "<true/>", quoted("SHA256", std::string(64, '0')));
+  grant("etc/b.plist", "<true/>", quoted("Unit", "x.service"));
+  ASSERT_EQ(::chmod(grant("etc/c.plist").c_str(), 0666), 0);
+  grant("lib/a.plist");
+  const Child caller(program);
+  const auto count = [] {
+    return std::distance(fs::directory_iterator("/proc/self/fd"), fs::directory_iterator());
+  };
+  expectGranted(caller.token());
+  const auto before = count();
+  for (int i = 0; i < 10; ++i) expectGranted(caller.token());
+  EXPECT_EQ(count(), before);
+}
+
+TEST_F(EntitlementFilesTest, SeveralThreadsMayAskAtTheSameTime) {
+  grant("etc/a.plist");
+  auto files = makeFiles();
+  const Child caller(program);
+  std::array<int, 4> granted{};
+  std::vector<std::thread> threads;
+  for (int& count : granted) {
+    threads.emplace_back([&files, &caller, &count] {
+      for (int i = 0; i < 50; ++i) {
+        const auto task = files.makeTask(caller.token());
+        if (task != nullptr && task->copyEntitlement(kName).value.asBoolean() == true) ++count;
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  EXPECT_THAT(granted, ElementsAre(50, 50, 50, 50));
+}
+
+TEST_F(EntitlementFilesTest, TheDirectoriesNamedAtBuildTimeAreUsedWhenNoneAreGiven) {
+  // Nothing grants this name anywhere; that the question is answered is all that can be said of this machine.
+  EntitlementFiles files(accounts);
+  const Child caller(program);
+  const auto task = files.makeTask(caller.token());
+  ASSERT_NE(task, nullptr);
+  EXPECT_FALSE(task->copyEntitlement("com.example.nobody-holds-this").value);
+}
+
+}  // namespace
+}  // namespace brenvik

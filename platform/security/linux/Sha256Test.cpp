@@ -1,0 +1,62 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/security/linux/Sha256.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/mman.h>
+#include <unistd.h>
+
+#include <string>
+
+#include "platform/base/UniqueFd.h"
+
+namespace brenvik {
+namespace {
+
+std::optional<Sha256Digest> digestOf(const std::string& bytes) {
+  const UniqueFd fd(::memfd_create("digest", MFD_CLOEXEC));
+  EXPECT_EQ(::write(fd.get(), bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+  ::lseek(fd.get(), 0, SEEK_SET);
+  return sha256OfFile(fd.get());
+}
+
+// Vectors of FIPS 180-4's examples.
+TEST(Sha256Test, TheStandardsExamplesComeOutRight) {
+  EXPECT_EQ(digestOf(""), parseSha256("e3b0c44298fc1c149afbf4c8996fb92427ae41e4649b934ca495991b7852b855"));
+  EXPECT_EQ(digestOf("abc"), parseSha256("ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad"));
+  EXPECT_EQ(digestOf(std::string(1'000'000, 'a')),
+            parseSha256("cdc76e5c9914fb9281a1c7e284d73e67f1809a48a497200e046d39ccc7112cd0"));
+}
+
+TEST(Sha256Test, WhatCannotBeReadHasNoDigest) {
+  EXPECT_FALSE(sha256OfFile(-1));
+  const UniqueFd folder(::open("/", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  EXPECT_FALSE(sha256OfFile(folder.get()));
+}
+
+TEST(Sha256Test, HexadecimalDigitsOfEitherCaseMeanTheSame) {
+  const std::string lower = "ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad";
+  std::string upper = lower;
+  for (char& c : upper) c = static_cast<char>(c >= 'a' && c <= 'f' ? c - 'a' + 'A' : c);
+  ASSERT_TRUE(parseSha256(lower));
+  EXPECT_EQ(parseSha256(lower), parseSha256(upper));
+  EXPECT_EQ((*parseSha256(lower))[0], 0xBA);
+  EXPECT_EQ((*parseSha256(lower))[31], 0xAD);
+}
+
+TEST(Sha256Test, OtherTextsAreNoDigest) {
+  const std::string good(64, '0');
+  EXPECT_TRUE(parseSha256(good));
+  EXPECT_FALSE(parseSha256(""));
+  EXPECT_FALSE(parseSha256(good.substr(1)));
+  EXPECT_FALSE(parseSha256(good + "0"));
+  for (const char wrong : {'g', 'G', '/', ':', '@', '`', ' ', '\0'}) {
+    std::string text = good;
+    text[33] = wrong;
+    EXPECT_FALSE(parseSha256(text)) << wrong;
+  }
+}
+
+}  // namespace
+}  // namespace brenvik
