@@ -1,0 +1,31 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "helper/core/EntryPoint.h"
+
+#include <memory>
+
+#include "platform/log/Log.h"
+
+namespace brenvik {
+
+int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests) {
+  std::shared_ptr<HostedBasebandServer> hosted;
+  if (baseband.canHost()) {
+    hosted = baseband.create(nullptr);
+    if (hosted != nullptr) hosted->start();
+  }
+
+  int status = 1;
+  if (ServerContext* const server = CreateServer(platform, kServiceName, requests); server != nullptr) {
+    if (hosted != nullptr) SetIdleCheck(server, [hosted] { return hosted->isBusy(); });
+    RunServer(*server);
+    DestroyServer(server);
+    status = 0;
+  }
+
+  if (hosted != nullptr) hosted->stop();
+  if (status != 0) logUnified(LogLevel::error, "unable to startup BrenvikMobileHelper server");
+  return status;
+}
+
+}  // namespace brenvik

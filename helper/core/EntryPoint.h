@@ -1,0 +1,15 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include "Helper/Shared/Server/HelperServerUtils.h"
+#include "platform/baseband/HostedBasebandServer.h"
+
+namespace brenvik {
+
+// The life of the process from the first service to the exit status: hosts the baseband server where there is
+// one, checks the service name in, serves until the idle rule ends it, and stops the hosted server. 0, or 1
+// when the service could not be set up (which is logged). Main thread.
+int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests);
+
+}  // namespace brenvik
