@@ -30,7 +30,8 @@ std::optional<std::string_view> utf8In(char* field) noexcept {
 }  // namespace
 
 KernelReturn PreferenceTransfer::setPreferenceValue(PortName /*port*/, char* domain, char* key,
-                                                    const void* valueBytes, std::uint32_t valueLength) noexcept {
+                                                    const void* valueBytes,
+                                                    std::uint32_t valueLength) noexcept {
   const auto domainText = utf8In(domain);
   const auto keyText = utf8In(key);
   if (!domainText || !keyText) return kern::failure;
@@ -87,7 +88,8 @@ KernelReturn PreferenceTransfer::copyValue(Scope scope, char* domain, char* key,
   return code;
 }
 
-KernelReturn PreferenceTransfer::loadPlistFile(PortName /*port*/, char* path, OutOfLinePayload* payload) noexcept {
+KernelReturn PreferenceTransfer::loadPlistFile(PortName /*port*/, char* path,
+                                               OutOfLinePayload* payload) noexcept {
   *payload = {};
   (void)terminated(path);
   logUnified(LogLevel::info, "Loading %s as plist", path);

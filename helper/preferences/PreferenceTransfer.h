@@ -28,15 +28,17 @@ class PreferenceTransfer {
   PreferenceTransfer(PreferencesStore& preferences, RegionAllocator& regions, DictionaryReader readDictionary)
       : preferences_(preferences), regions_(regions), readDictionary_(std::move(readDictionary)) {}
 
-  // Stores the property list serialized in these bytes (any format) under the key, for the current user on any
-  // host. A single byte, whatever it is, removes the key. The bytes stay the caller's.
+  // Stores the property list serialized in these bytes (any format) under the key, for the current user on
+  // any host. A single byte, whatever it is, removes the key. The bytes stay the caller's.
   KernelReturn setPreferenceValue(PortName port, char* domain, char* key, const void* valueBytes,
                                   std::uint32_t valueLength) noexcept;
 
   // The key's value, for the current user on any host or in application scope. A key without a value is a
   // success with an empty payload.
-  KernelReturn copyPreferenceValue(PortName port, char* domain, char* key, OutOfLinePayload* payload) noexcept;
-  KernelReturn copyAppPreferenceValue(PortName port, char* domain, char* key, OutOfLinePayload* payload) noexcept;
+  KernelReturn copyPreferenceValue(PortName port, char* domain, char* key,
+                                   OutOfLinePayload* payload) noexcept;
+  KernelReturn copyAppPreferenceValue(PortName port, char* domain, char* key,
+                                      OutOfLinePayload* payload) noexcept;
 
   // The file's dictionary. Any file that the helper can read will do: no policy of paths applies.
   KernelReturn loadPlistFile(PortName port, char* path, OutOfLinePayload* payload) noexcept;
