@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "platform/log/Log.h"
+#include "platform/plist/PropertyListCodec.h"
 #include "platform/preferences/PreferencesStore.h"
 
 namespace brenvik {
@@ -78,12 +79,15 @@ class InMemoryPreferences final : public PreferencesStore {
     const std::lock_guard lock(mutex_);
     const InMemoryDisk::DomainName name{std::string(domain), user, host};
     Cached& cached = domains_[name];
-    const auto pending = std::exchange(cached.pending, {});
+    auto pending = std::exchange(cached.pending, {});
+    const bool isSound =
+        std::erase_if(pending, [](const auto& one) { return !canBeStored(one.first, one.second); }) == 0;
+    if (!isSound) logUnified(LogLevel::error, "Preferences: a value is too deep or too large to be stored");
     const bool isStored = pending.empty() || disk_->merge(name, pending);
     if (!isStored) logUnified(LogLevel::error, "Preferences: the disk is full");
     cached.values = disk_->read(name);
     cached.isLoaded = true;
-    return isStored;
+    return isStored && isSound;
   }
 
   PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
@@ -132,6 +136,12 @@ class InMemoryPreferences final : public PreferencesStore {
     InMemoryDisk::Values values;
     bool isLoaded = false;
   };
+
+  // A domain is a dictionary, so a value may be a level less deep than a document.
+  static bool canBeStored(const std::string& key, const PropertyList& value) {
+    const auto entry = PropertyList::dictionary({{key, value ? value : PropertyList::boolean(true)}});
+    return serializePropertyList(entry, PropertyListFormat::binary).has_value();
+  }
 
   InMemoryDisk own_;
   InMemoryDisk* const disk_;
