@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <array>
 #include <string>
 #include <string_view>
 
@@ -12,29 +13,48 @@ namespace brenvik {
 enum class UserScope { currentUser, anyUser };
 enum class HostScope { currentHost, anyHost };
 
+struct PreferencesScope {
+  UserScope user;
+  HostScope host;
+};
+
+// Where application scope looks, in this order.
+inline constexpr std::array kApplicationScopes{
+    PreferencesScope{UserScope::currentUser, HostScope::currentHost},
+    PreferencesScope{UserScope::currentUser, HostScope::anyHost},
+    PreferencesScope{UserScope::anyUser, HostScope::anyHost}};
+
+// False for a domain that stands for nothing that could be stored: empty, "." or "..", or with a '/' or a
+// NUL.
+constexpr bool namesPreferencesFile(std::string_view domain) noexcept {
+  return !domain.empty() && domain != "." && domain != ".." &&
+         domain.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
+}
+
 // The platform's preferences: values by domain, key, user scope and host scope. Any thread. Texts are UTF-8.
 //
 // A set value is seen by this process at once and by other processes after synchronize(), which also takes
-// over what they have written. A domain that names no file (empty, "." or "..", or with a '/') reads as
-// having no values; writing it stores nothing and logs an error.
+// over what they have written. A domain that names no file reads as having no values; setting a value there
+// stores nothing and logs an error.
 class PreferencesStore {
  public:
   virtual ~PreferencesStore() = default;
 
   // Sets the key's value; no value removes the key.
-  virtual void setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
-                        HostScope host) noexcept = 0;
+  virtual void setValue(std::string_view key, const PropertyList& value, std::string_view domain,
+                        UserScope user, HostScope host) noexcept = 0;
 
-  // Makes what was set durable and reads what others wrote. False when something set could not be stored; it
-  // is then dropped, so that what is read is what is stored.
+  // Makes what was set durable and reads what others wrote; keys that were not set here stay as others left
+  // them. False when something set could not be stored, which is logged; it is then dropped, so that what is
+  // read is what is stored. False, too, for a domain that names no file.
   virtual bool synchronize(std::string_view domain, UserScope user, HostScope host) noexcept = 0;
 
   // The key's value in exactly this scope, or none.
   virtual PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
                                  HostScope host) noexcept = 0;
 
-  // Application scope: current user and current host, then current user and any host, then any user and any
-  // host; the first that has the key gives the value.
+  // Application scope: the first of kApplicationScopes that has the key gives the value. A scope that has no
+  // place on this system is passed over.
   virtual bool synchronizeApplication(std::string_view domain) noexcept = 0;
   virtual PropertyList copyApplicationValue(std::string_view key, std::string_view domain) noexcept = 0;
 

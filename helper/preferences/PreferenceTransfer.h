@@ -1,0 +1,55 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstdint>
+#include <functional>
+
+#include "helper/payload/OutOfLinePayload.h"
+#include "interface/Wire.h"
+#include "platform/ipc/RegionAllocator.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/preferences/PreferencesStore.h"
+
+namespace brenvik {
+
+// Reads the file at the path as a dictionary property list; no value when it is missing, unreadable or
+// anything else. What it needs lives for one call. Throws nothing.
+using DictionaryReader = std::function<PropertyList(const char* path)>;
+
+// The routines that carry preference values and property-list files between the helper and its callers.
+// Main loop only; keeps nothing between requests.
+//
+// Text arguments are the 256-byte fields of the request: each is ended by force at its last byte. `port` is
+// not looked at. The status is a kernel-style code; a payload is made only with success.
+class PreferenceTransfer {
+ public:
+  // The references outlive the object.
+  PreferenceTransfer(PreferencesStore& preferences, RegionAllocator& regions, DictionaryReader readDictionary)
+      : preferences_(preferences), regions_(regions), readDictionary_(std::move(readDictionary)) {}
+
+  // Stores the property list serialized in these bytes (any format) under the key, for the current user on
+  // any host. A single byte, whatever it is, removes the key. The bytes stay the caller's.
+  KernelReturn setPreferenceValue(PortName port, char* domain, char* key, const void* valueBytes,
+                                  std::uint32_t valueLength) noexcept;
+
+  // The key's value, for the current user on any host or in application scope. A key without a value is a
+  // success with an empty payload.
+  KernelReturn copyPreferenceValue(PortName port, char* domain, char* key,
+                                   OutOfLinePayload* payload) noexcept;
+  KernelReturn copyAppPreferenceValue(PortName port, char* domain, char* key,
+                                      OutOfLinePayload* payload) noexcept;
+
+  // The file's dictionary. Any file that the helper can read will do: no policy of paths applies.
+  KernelReturn loadPlistFile(PortName port, char* path, OutOfLinePayload* payload) noexcept;
+
+ private:
+  enum class Scope { currentUser, application };
+  KernelReturn copyValue(Scope scope, char* domain, char* key, OutOfLinePayload* payload) noexcept;
+
+  PreferencesStore& preferences_;
+  RegionAllocator& regions_;
+  const DictionaryReader readDictionary_;
+};
+
+}  // namespace brenvik

@@ -1,0 +1,307 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/preferences/linux/FilePreferences.h"
+
+#include <fcntl.h>
+#include <pwd.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <map>
+#include <new>
+#include <utility>
+#include <vector>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/log/Log.h"
+#include "platform/preferences/linux/DomainFile.h"
+#include "platform/preferences/linux/DomainImage.h"
+
+#ifndef BRENVIK_ANY_USER_PREFERENCES
+#error "the build says where the preferences of any user are"
+#endif
+
+namespace brenvik {
+namespace {
+
+// Clients name domains freely; each that is kept costs its content and one descriptor.
+constexpr std::size_t kMostDomains = 16;
+constexpr std::size_t kMostKeptBytes = std::size_t{16} << 20;
+
+std::string homeOfEffectiveUser() {
+  std::vector<char> buffer(1024);
+  passwd entry{};
+  passwd* found = nullptr;
+  int error = 0;
+  while ((error = ::getpwuid_r(::geteuid(), &entry, buffer.data(), buffer.size(), &found)) == ERANGE) {
+    buffer.resize(buffer.size() * 2);
+  }
+  return error == 0 && found != nullptr && found->pw_dir != nullptr ? found->pw_dir : "";
+}
+
+// machine-id(5): 32 lower-case hexadecimal digits and a line feed.
+std::string machineId() {
+  const UniqueFd file(::open("/etc/machine-id", O_RDONLY | O_CLOEXEC | O_NOCTTY));
+  std::array<char, 64> text{};
+  const ssize_t got = file.isValid() ? ::read(file.get(), text.data(), text.size()) : -1;
+  std::string id(text.data(), got > 0 ? static_cast<std::size_t>(got) : 0);
+  if (!id.empty() && id.back() == '\n') id.pop_back();
+  const bool isId = id.size() == 32 && id.find_first_not_of("0123456789abcdef") == std::string::npos;
+  return isId ? id : std::string();
+}
+
+}  // namespace
+
+// One domain in one scope: its file as last seen, and what was set since.
+class FilePreferences::Domain {
+ public:
+  Domain(DomainPlace place, std::string name, std::chrono::milliseconds patience)
+      : name_(std::move(name)), file_(std::move(place)), patience_(patience) {}
+
+  const std::string& name() const noexcept { return name_; }
+  const std::string& path() const noexcept { return file_.path(); }
+
+  void setValue(std::string_view key, const PropertyList& value) {
+    const std::lock_guard lock(mutex_);
+    try {
+      pending_.insert_or_assign(std::string(key), value);
+    } catch (const std::bad_alloc&) {
+      isIncomplete_ = true;
+      throw;
+    }
+  }
+
+  PropertyList copyValue(std::string_view key) {
+    const std::lock_guard lock(mutex_);
+    if (const auto set = pending_.find(key); set != pending_.end()) return set->second;
+    if (!isLoaded_) load(nullptr);
+    return image_.find(key);
+  }
+
+  bool synchronize() {
+    const std::lock_guard lock(mutex_);
+    const bool isComplete = !std::exchange(isIncomplete_, false);
+    if (pending_.empty()) {
+      if (!isCurrent()) load(nullptr);
+      return isComplete;
+    }
+    // Also when memory runs out on the way: what was not stored is dropped, and the file is read anew.
+    struct Drop {
+      Domain& domain;
+      bool isStored = false;
+      ~Drop() {
+        domain.pending_.clear();
+        if (!isStored) domain.forgetContent();
+      }
+    } drop{*this};
+    drop.isStored = store();
+    return drop.isStored && isComplete;
+  }
+
+  void forget() noexcept {
+    const std::lock_guard lock(mutex_);
+    forgetContent();
+  }
+
+  // Bytes that forgetting this domain would free; nothing while it may not be forgotten.
+  std::optional<std::size_t> weight() {
+    const std::unique_lock lock(mutex_, std::try_to_lock);
+    if (!lock.owns_lock() || !pending_.empty()) return std::nullopt;
+    return image_.memory();
+  }
+
+ private:
+  bool isCurrent() const noexcept { return isLoaded_ && isSettled_ && file_.stamp() == stamp_; }
+
+  void forgetContent() noexcept {
+    image_ = DomainImage();
+    stamp_ = {};
+    pin_.reset();
+    isLoaded_ = isDurable_ = canStore_ = false;
+  }
+
+  void load(const FolderLock* held) {
+    forgetContent();
+    DomainFile::Loaded loaded = file_.load(patience_, held);
+    image_ = std::move(loaded.image);
+    stamp_ = loaded.stamp;
+    pin_ = std::move(loaded.pin);
+    isSettled_ = loaded.isSettled;
+    canStore_ = loaded.state != DomainFile::State::unavailable;
+    isLoaded_ = true;
+  }
+
+  bool store() {
+    const UniqueFd folder = file_.openFolder();
+    FolderLock held;
+    if (!folder.isValid() || !file_.lock(folder.get(), patience_, held)) return false;
+    if (!isCurrent()) load(&held);
+    if (!canStore_) return false;
+    bool isWhole = true;
+    bool isChanged = false;
+    for (const auto& [key, value] : pending_) {
+      switch (image_.set(key, value)) {
+        case DomainImage::Change::none:
+          break;
+        case DomainImage::Change::made:
+          isChanged = true;
+          break;
+        case DomainImage::Change::refused:
+          logUnified(LogLevel::error, "Preferences %s: a value is too deep or too large to be stored",
+                     path().c_str());
+          isWhole = false;
+          break;
+      }
+    }
+    // Nothing to do for what stands in the file already, unless someone else wrote it and perhaps did not
+    // sync.
+    const bool isStored = !isChanged && (isDurable_ || stamp_.size < 0);
+    if (isStored) return isWhole;
+    isDurable_ = false;
+    const auto content = image_.content();
+    if (!file_.replace(folder.get(), content, stamp_, pin_)) return false;
+    isDurable_ = isSettled_ = true;
+    return isWhole;
+  }
+
+  const std::string name_;
+  DomainFile file_;
+  const std::chrono::milliseconds patience_;
+
+  std::mutex mutex_;                                          // of what follows
+  std::map<std::string, PropertyList, std::less<>> pending_;  // no value: to be removed
+  bool isIncomplete_ = false;  // there was no memory to keep something that was set
+  DomainImage image_;          // of the file
+  FileStamp stamp_;
+  UniqueFd pin_;
+  bool isLoaded_ = false;
+  bool isSettled_ = false;
+  bool isDurable_ = false;  // this object wrote the file as it stands
+  bool canStore_ = false;
+};
+
+FilePreferences::Places FilePreferences::systemPlaces() {
+  return {homeOfEffectiveUser(), BRENVIK_ANY_USER_PREFERENCES, machineId()};
+}
+
+FilePreferences::FilePreferences(std::function<Places()> places, std::chrono::milliseconds patience)
+    : askForPlaces_(std::move(places)), patience_(patience) {}
+
+FilePreferences::~FilePreferences() = default;
+
+std::optional<DomainPlace> FilePreferences::placeOf(std::string_view domain, UserScope user, HostScope host) {
+  if (!namesPreferencesFile(domain)) return std::nullopt;
+  if (!places_) places_ = askForPlaces_();
+  DomainPlace place;
+  if (user == UserScope::currentUser) {
+    if (places_->home.empty()) return std::nullopt;
+    place = {places_->home, "Library/Preferences", "", 0700, 0600};
+  } else {
+    if (places_->anyUser.empty()) return std::nullopt;
+    // What is for any user can be read by any user.
+    place = {"/", places_->anyUser, "", 0755, 0644};
+  }
+  place.name = domain;
+  if (host == HostScope::currentHost) {
+    if (places_->machineId.empty()) return std::nullopt;
+    place.folder += "/ByHost";
+    place.name += "." + places_->machineId;
+  }
+  place.name += ".plist";
+  return place;
+}
+
+std::shared_ptr<FilePreferences::Domain> FilePreferences::find(std::string_view domain, UserScope user,
+                                                               HostScope host) {
+  const std::lock_guard lock(mutex_);
+  auto place = placeOf(domain, user, host);
+  if (!place) return nullptr;
+  const std::string path = place->path();
+  const auto known = std::find_if(domains_.begin(), domains_.end(),
+                                  [&path](const auto& one) { return one->path() == path; });
+  if (known != domains_.end()) {
+    domains_.splice(domains_.begin(), domains_, known);
+    return domains_.front();
+  }
+  std::size_t count = 0;
+  std::size_t bytes = 0;
+  for (auto one = domains_.begin(); one != domains_.end();) {
+    const auto weight = one->use_count() > 1 ? std::nullopt : (*one)->weight();
+    ++count;
+    bytes += weight.value_or(0);
+    one = weight && (count >= kMostDomains || bytes > kMostKeptBytes) ? domains_.erase(one) : std::next(one);
+  }
+  domains_.push_front(std::make_shared<Domain>(std::move(*place), std::string(domain), patience_));
+  return domains_.front();
+}
+
+void FilePreferences::setValue(std::string_view key, const PropertyList& value, std::string_view domain,
+                               UserScope user, HostScope host) noexcept {
+  try {
+    if (const auto found = find(domain, user, host)) return found->setValue(key, value);
+    logUnified(LogLevel::error, "Preferences: domain \"%.*s\" names no file, nothing is stored",
+               static_cast<int>(domain.size()), domain.data());
+  } catch (const std::bad_alloc&) {
+    logUnified(LogLevel::error, "Preferences: no memory to set a value");
+  }
+}
+
+bool FilePreferences::synchronize(std::string_view domain, UserScope user, HostScope host) noexcept {
+  try {
+    const auto found = find(domain, user, host);
+    return found != nullptr && found->synchronize();
+  } catch (const std::bad_alloc&) {
+    logUnified(LogLevel::error, "Preferences: no memory to store a domain");
+    return false;
+  }
+}
+
+PropertyList FilePreferences::copyValue(std::string_view key, std::string_view domain, UserScope user,
+                                        HostScope host) noexcept {
+  try {
+    const auto found = find(domain, user, host);
+    return found != nullptr ? found->copyValue(key) : PropertyList();
+  } catch (const std::bad_alloc&) {
+    return {};
+  }
+}
+
+bool FilePreferences::synchronizeApplication(std::string_view domain) noexcept {
+  bool isWhole = namesPreferencesFile(domain);
+  try {
+    for (const auto [user, host] : kApplicationScopes) {
+      if (const auto found = find(domain, user, host)) isWhole = found->synchronize() && isWhole;
+    }
+  } catch (const std::bad_alloc&) {
+    logUnified(LogLevel::error, "Preferences: no memory to store a domain");
+    return false;
+  }
+  return isWhole;
+}
+
+PropertyList FilePreferences::copyApplicationValue(std::string_view key, std::string_view domain) noexcept {
+  for (const auto [user, host] : kApplicationScopes) {
+    if (PropertyList value = copyValue(key, domain, user, host)) return value;
+  }
+  return {};
+}
+
+void FilePreferences::flushCachesForAnyUser(const std::string* domain) noexcept {
+  if (domain == nullptr) return;
+  try {
+    std::vector<std::shared_ptr<Domain>> found;
+    {
+      const std::lock_guard lock(mutex_);
+      for (const auto& one : domains_) {
+        if (one->name() == *domain) found.push_back(one);
+      }
+    }
+    for (const auto& one : found) one->forget();
+  } catch (const std::bad_alloc&) {
+    logUnified(LogLevel::error, "Preferences: no memory to flush a domain");
+  }
+}
+
+}  // namespace brenvik

@@ -1,0 +1,74 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <chrono>
+#include <functional>
+#include <list>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "platform/preferences/PreferencesStore.h"
+
+namespace brenvik {
+
+struct DomainPlace;
+
+// Preferences in files: one binary property list a domain (one in XML is read as well), written whole to a
+// temporary file, synced, renamed and the folder synced, under a lock that all writers of a folder share.
+//
+//   current user, any host      <home>/Library/Preferences/<domain>.plist
+//   current user, current host  <home>/Library/Preferences/ByHost/<domain>.<machine id>.plist
+//   any user, any host          <any user>/<domain>.plist
+//   any user, current host      <any user>/ByHost/<domain>.<machine id>.plist
+//
+// Only the keys that were set are written: what others put under other keys meanwhile stays. A file that is
+// damaged or cannot be read is moved aside beside itself and logged, never written over.
+//
+// Any thread; a domain is used by one at a time, and synchronize() holds it for as long as the disk takes.
+class FilePreferences final : public PreferencesStore {
+ public:
+  struct Places {
+    std::string home;       // of the user whose preferences these are; empty: has none
+    std::string anyUser;    // absolute
+    std::string machineId;  // empty: unknown, so that nothing can be kept for the current host
+  };
+  // The effective user's home directory, the folder compiled in, and /etc/machine-id.
+  static Places systemPlaces();
+
+  // How long a writer waits for others that write in the same folder, before it gives up.
+  static constexpr std::chrono::milliseconds kPatience{1000};
+
+  // `places` is asked once, when the first domain is used.
+  explicit FilePreferences(std::function<Places()> places = systemPlaces,
+                           std::chrono::milliseconds patience = kPatience);
+  FilePreferences(const FilePreferences&) = delete;
+  FilePreferences& operator=(const FilePreferences&) = delete;
+  ~FilePreferences() override;
+
+  void setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
+                HostScope host) noexcept override;
+  bool synchronize(std::string_view domain, UserScope user, HostScope host) noexcept override;
+  PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
+                         HostScope host) noexcept override;
+  bool synchronizeApplication(std::string_view domain) noexcept override;
+  PropertyList copyApplicationValue(std::string_view key, std::string_view domain) noexcept override;
+  void flushCachesForAnyUser(const std::string* domain) noexcept override;
+
+ private:
+  class Domain;
+
+  std::optional<DomainPlace> placeOf(std::string_view domain, UserScope user, HostScope host);
+  // Null when the domain names no file there. May throw std::bad_alloc.
+  std::shared_ptr<Domain> find(std::string_view domain, UserScope user, HostScope host);
+
+  const std::function<Places()> askForPlaces_;
+  const std::chrono::milliseconds patience_;
+  std::mutex mutex_;  // of what follows; never held while a domain works
+  std::optional<Places> places_;
+  std::list<std::shared_ptr<Domain>> domains_;  // last used first
+};
+
+}  // namespace brenvik

@@ -1,0 +1,642 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/preferences/linux/FilePreferences.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sched.h>
+#include <sys/file.h>
+#include <sys/mount.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <cstdio>
+#include <span>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/plist/PropertyListCodec.h"
+#include "platform/preferences/linux/DomainImage.h"
+#include "platform/preferences/linux/TestHome.h"
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+namespace fs = std::filesystem;
+
+constexpr auto kUser = UserScope::currentUser;
+constexpr auto kHost = HostScope::anyHost;
+
+std::string binary(const PropertyList& value) {
+  return *serializePropertyList(value, PropertyListFormat::binary);
+}
+
+PropertyList textDictionary(const std::string& key, const std::string& text) {
+  return PropertyList::dictionary({{key, PropertyList::string(text)}});
+}
+
+mode_t modeOf(const fs::path& path) {
+  struct stat facts;
+  return ::stat(path.c_str(), &facts) == 0 ? facts.st_mode & 07777 : 0;
+}
+
+class FilePreferencesTest : public testing::Test {
+ protected:
+  static constexpr const char kDomain[] = "com.example.files";
+
+  void set(FilePreferences& store, std::string_view key, std::string_view text) {
+    store.setValue(key, PropertyList::string(text), kDomain, kUser, kHost);
+  }
+  bool setNow(FilePreferences& store, std::string_view key, std::string_view text) {
+    set(store, key, text);
+    return sync(store);
+  }
+  bool sync(FilePreferences& store) { return store.synchronize(kDomain, kUser, kHost); }
+  std::string get(FilePreferences& store, std::string_view key) {
+    const PropertyList value = store.copyValue(key, kDomain, kUser, kHost);
+    return value ? std::string(value.asString().value_or("(no string)")) : "(none)";
+  }
+  PropertyList onDisk() const {
+    const std::string bytes = TestHome::read(file);
+    return parsePropertyList(std::as_bytes(std::span(bytes)));
+  }
+  // The one line logged since the last call.
+  std::string onlyLine() {
+    const auto entries = log.entries();
+    log.clear();
+    if (entries.size() != 1) return std::to_string(entries.size()) + " lines";
+    return entries[0] == RecordingLog::unifiedLine(LogLevel::error, entries[0].line) ? entries[0].line
+                                                                                     : "not an error";
+  }
+  std::string line(const std::string& rest) const { return "Preferences " + file.string() + ": " + rest; }
+
+  TestHome home;
+  const fs::path file = home.file(kDomain);
+  RecordingLog log;
+  std::unique_ptr<FilePreferences> ours = home.open();
+};
+
+// ---- places -----------------------------------------------------------------------------------------------
+
+TEST_F(FilePreferencesTest, EachScopeHasItsPlaceAndOnlyWhatIsForAnyUserCanBeReadByOthers) {
+  const mode_t mask = ::umask(077);
+  const auto store = [this](UserScope user, HostScope host) {
+    ours->setValue("key", PropertyList::boolean(true), "d", user, host);
+    return ours->synchronize("d", user, host);
+  };
+  const std::string byHost = "ByHost/d." + std::string(TestHome::kMachine) + ".plist";
+  EXPECT_TRUE(store(UserScope::currentUser, HostScope::anyHost));
+  EXPECT_EQ(modeOf(home.folder() / "d.plist"), 0600u);
+  EXPECT_TRUE(store(UserScope::currentUser, HostScope::currentHost));
+  EXPECT_EQ(modeOf(home.folder() / byHost), 0600u);
+  EXPECT_EQ(modeOf(home.home() / "Library"), 0700u);
+  EXPECT_EQ(modeOf(home.folder()), 0700u);
+  EXPECT_EQ(modeOf(home.folder() / "ByHost"), 0700u);
+  EXPECT_TRUE(store(UserScope::anyUser, HostScope::anyHost));
+  EXPECT_EQ(modeOf(home.anyUser() / "d.plist"), 0644u);
+  EXPECT_TRUE(store(UserScope::anyUser, HostScope::currentHost));
+  EXPECT_EQ(modeOf(home.anyUser() / byHost), 0644u);
+  EXPECT_EQ(modeOf(home.anyUser()), 0755u);
+  ::umask(mask);
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(FilePreferencesTest, ReadingMakesNothing) {
+  EXPECT_EQ(get(*ours, "key"), "(none)");
+  EXPECT_TRUE(sync(*ours));
+  EXPECT_TRUE(ours->synchronizeApplication(kDomain));
+  EXPECT_TRUE(fs::is_empty(home.home()));
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(FilePreferencesTest, PlacesAreAskedForOnceAndNotBeforeTheyAreNeeded) {
+  int asked = 0;
+  FilePreferences store([&] {
+    ++asked;
+    return home.places();
+  });
+  EXPECT_EQ(asked, 0);
+  EXPECT_TRUE(setNow(store, "key", "value"));
+  store.synchronizeApplication(kDomain);
+  EXPECT_EQ(asked, 1);
+}
+
+TEST_F(FilePreferencesTest, TheSystemsPlacesAreTheEffectiveUsersHomeAndTheMachinesId) {
+  const auto places = FilePreferences::systemPlaces();
+  EXPECT_TRUE(places.home.starts_with("/"));
+  EXPECT_TRUE(places.anyUser.starts_with("/"));
+  EXPECT_TRUE(places.machineId.empty() || places.machineId.size() == 32);
+}
+
+TEST_F(FilePreferencesTest, WithoutAHomeOrAMachineIdThoseScopesHoldNothing) {
+  FilePreferences store([this] { return FilePreferences::Places{"", home.anyUser(), ""}; });
+  for (const auto [user, host] : {PreferencesScope{kUser, kHost},
+                                  {kUser, HostScope::currentHost},
+                                  {UserScope::anyUser, HostScope::currentHost}}) {
+    store.setValue("key", PropertyList::boolean(true), kDomain, user, host);
+    EXPECT_EQ(onlyLine(), "Preferences: domain \"com.example.files\" names no file, nothing is stored");
+    EXPECT_FALSE(store.synchronize(kDomain, user, host));
+    EXPECT_FALSE(store.copyValue("key", kDomain, user, host));
+  }
+  store.setValue("key", PropertyList::boolean(true), kDomain, UserScope::anyUser, kHost);
+  EXPECT_TRUE(store.synchronizeApplication(kDomain));
+  EXPECT_TRUE(store.copyApplicationValue("key", kDomain));
+}
+
+TEST_F(FilePreferencesTest, AHomeThatDoesNotExistIsNotMade) {
+  fs::remove(home.home());
+  EXPECT_FALSE(setNow(*ours, "key", "value"));
+  EXPECT_EQ(onlyLine(), line("open home: No such file or directory"));
+  EXPECT_FALSE(fs::exists(home.home()));
+}
+
+TEST_F(FilePreferencesTest, AFileWhereAFolderBelongsFailsTheSetAndIsLeftAlone) {
+  std::ofstream(home.home() / "Library") << "a file";
+  EXPECT_EQ(get(*ours, "key"), "(none)");
+  EXPECT_TRUE(sync(*ours));
+  EXPECT_FALSE(setNow(*ours, "key", "value"));
+  EXPECT_EQ(onlyLine(), line("open folder: Not a directory"));
+  EXPECT_EQ(TestHome::read(home.home() / "Library"), "a file");
+}
+
+TEST_F(FilePreferencesTest, ADomainTooLongForAFileNameReadsAsEmptyAndFailsTheSet) {
+  const std::string longest(NAME_MAX - 6, 'd');
+  ours->setValue("key", PropertyList::boolean(true), longest, kUser, kHost);
+  EXPECT_TRUE(ours->synchronize(longest, kUser, kHost));
+  const std::string tooLong = longest + "d";
+  EXPECT_FALSE(ours->copyValue("key", tooLong, kUser, kHost));
+  EXPECT_TRUE(ours->synchronize(tooLong, kUser, kHost));
+  EXPECT_TRUE(log.entries().empty());
+  ours->setValue("key", PropertyList::boolean(true), tooLong, kUser, kHost);
+  EXPECT_FALSE(ours->synchronize(tooLong, kUser, kHost));
+  EXPECT_TRUE(onlyLine().ends_with(": rename: File name too long"));
+  EXPECT_EQ(home.files(), std::vector{longest + ".plist"});
+}
+
+// ---- what is written
+// ----------------------------------------------------------------------------------------
+
+TEST_F(FilePreferencesTest, ASetIsSyncedBeforeItTakesThePlaceAndTheFolderAfter) {
+  SystemCalls calls;
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  // The two folders that were made come first, each held fast in its parent.
+  EXPECT_EQ(calls.trace, (std::vector<std::string>{"fsync folder", "fsync folder", "write", "fsync file",
+                                                   "rename", "fsync folder"}));
+  calls.trace.clear();
+  ASSERT_TRUE(setNow(*ours, "key", "other"));
+  EXPECT_EQ(calls.trace, (std::vector<std::string>{"write", "fsync file", "rename", "fsync folder"}));
+  EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+}
+
+TEST_F(FilePreferencesTest, WhatStandsInAFileOfOursIsNotWrittenAgainAndInAForeignOneItIs) {
+  home.write(kDomain, binary(textDictionary("key", "value")));
+  SystemCalls calls;
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  EXPECT_EQ(calls.trace.size(), 4u) << "who knows whether the other writer synced it";
+  calls.trace.clear();
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  ours->setValue("never there", {}, kDomain, kUser, kHost);
+  ASSERT_TRUE(sync(*ours));
+  EXPECT_TRUE(calls.trace.empty());
+}
+
+TEST_F(FilePreferencesTest, AShortWriteIsContinued) {
+  SystemCalls calls;
+  calls.writeLimit = 7;
+  ASSERT_TRUE(setNow(*ours, "key", std::string(100, 'v')));
+  EXPECT_EQ(onDisk(), textDictionary("key", std::string(100, 'v')));
+}
+
+TEST_F(FilePreferencesTest, AnyFailureOnTheWayLeavesTheOldFileWholeAndNoTemporaryOne) {
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  const std::string before = TestHome::read(file);
+  const auto fails = [&](int SystemCalls::*which, int error, const char* what) {
+    {
+      SystemCalls calls;
+      calls.*which = error;
+      EXPECT_FALSE(setNow(*ours, "key", "new"));
+    }
+    EXPECT_EQ(onlyLine(), line(what));
+    EXPECT_EQ(TestHome::read(file), before);
+    EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+    EXPECT_EQ(get(*ours, "key"), "old");
+    EXPECT_TRUE(sync(*ours)) << "nothing is waiting any more";
+  };
+  fails(&SystemCalls::failWrite, ENOSPC, "write: No space left on device");
+  fails(&SystemCalls::failWrite, EDQUOT, "write: Disk quota exceeded");
+  fails(&SystemCalls::failFileSync, EIO, "fsync: Input/output error");
+  fails(&SystemCalls::failRename, EACCES, "rename: Permission denied");
+  EXPECT_TRUE(setNow(*ours, "key", "new"));
+}
+
+TEST_F(FilePreferencesTest, ASetWhoseFolderCannotBeSyncedIsNotAnsweredAsStored) {
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  {
+    SystemCalls calls;
+    calls.failFolderSync = EIO;
+    EXPECT_FALSE(setNow(*ours, "key", "new"));
+  }
+  EXPECT_EQ(onlyLine(), line("fsync of the folder: Input/output error"));
+  EXPECT_EQ(get(*ours, "key"), "new") << "it is in its place, only perhaps not for good";
+  SystemCalls calls;
+  EXPECT_TRUE(setNow(*ours, "key", "new"));
+  EXPECT_EQ(calls.trace.size(), 4u) << "so the next set stores it again";
+}
+
+TEST_F(FilePreferencesTest, WhatADeadWriterLeftIsClearedAway) {
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  std::ofstream(home.folder() / ".brenvik-preferences.tmp") << "half a fi";
+  ASSERT_TRUE(setNow(*ours, "key", "other"));
+  EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+  EXPECT_EQ(onDisk(), textDictionary("key", "other"));
+}
+
+TEST_F(FilePreferencesTest, NothingIsWrittenThroughLinks) {
+  const fs::path victim = home.root() / "victim";
+  std::ofstream(victim) << binary(textDictionary("victim", "whole"));
+  const std::string before = TestHome::read(victim);
+  fs::create_directories(home.folder());
+  fs::create_symlink(victim, home.folder() / ".brenvik-preferences.tmp");
+  fs::create_symlink(victim, file);
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  EXPECT_EQ(TestHome::read(victim), before);
+  EXPECT_FALSE(fs::is_symlink(file));
+  EXPECT_EQ(get(*ours, "victim"), "whole") << "a link may stand for the file, so it was read";
+  EXPECT_EQ(get(*ours, "key"), "value");
+
+  fs::remove(home.folder() / ".brenvik-preferences.lock");
+  fs::create_symlink(victim, home.folder() / ".brenvik-preferences.lock");
+  EXPECT_FALSE(setNow(*ours, "key", "other"));
+  EXPECT_EQ(onlyLine(), line("lock: Too many levels of symbolic links"));
+}
+
+TEST_F(FilePreferencesTest, PythonReadsWhatIsWritten) {
+  if (std::system("python3 -c 'import plistlib' 2>/dev/null") != 0)
+    GTEST_SKIP() << "no python3 with plistlib";
+  for (int i = 0; i < 300; ++i)
+    ours->setValue("key" + std::to_string(i), PropertyList::integer(i * i), kDomain, kUser, kHost);
+  ours->setValue("gr\xC3\xBC\xC3\x9F", PropertyList::string("\xE2\x82\xAC\xF0\x9F\x98\x80"), kDomain, kUser,
+                 kHost);
+  const std::byte bytes[] = {std::byte{0}, std::byte{255}};
+  const auto nested = PropertyList::dictionary(
+      {{"data", PropertyList::data(bytes)},
+       {"list", PropertyList::array({PropertyList::integer(-5), PropertyList::unsignedInteger(UINT64_MAX),
+                                     PropertyList::real(0.5), PropertyList::boolean(false)})},
+       {"when", PropertyList::date(0)}});
+  ours->setValue("nested", nested, kDomain, kUser, kHost);
+  ASSERT_TRUE(sync(*ours));
+  // Changed in place, grown and shrunk.
+  ours->setValue("key7", nested, kDomain, kUser, kHost);
+  ours->setValue("key8", {}, kDomain, kUser, kHost);
+  ours->setValue("key9", PropertyList::string(std::string(1000, 'x')), kDomain, kUser, kHost);
+  ASSERT_TRUE(sync(*ours));
+
+  const std::string program = R"(
+import plistlib, datetime
+d = plistlib.load(open(')" + file.string() +
+                              R"(', 'rb'))
+n = {'data': b'\x00\xff', 'list': [-5, 2**64 - 1, 0.5, False], 'when': datetime.datetime(2001, 1, 1)}
+e = {'key%d' % i: i * i for i in range(300)}
+e.update({'gr\u00fc\u00df': '\u20ac\U0001f600', 'nested': n, 'key7': n, 'key9': 'x' * 1000})
+del e['key8']
+assert d == e, d
+)";
+  const fs::path script = home.root() / "check.py";
+  std::ofstream(script) << program;
+  EXPECT_EQ(std::system(("python3 " + script.string()).c_str()), 0);
+}
+
+TEST_F(FilePreferencesTest, AFileThatPythonWroteIsReadAndChanged) {
+  if (std::system("python3 -c 'import plistlib' 2>/dev/null") != 0)
+    GTEST_SKIP() << "no python3 with plistlib";
+  fs::create_directories(home.folder());
+  for (const char* format : {"FMT_BINARY", "FMT_XML"}) {
+    const fs::path script = home.root() / "write.py";
+    std::ofstream(script)
+        << "import plistlib\nplistlib.dump({'a': [1, 'x', {'b': 2.5}], 'key': 'old'}, open('" << file.string()
+        << "', 'wb'), fmt=plistlib." << format << ")\n";
+    ASSERT_EQ(std::system(("python3 " + script.string()).c_str()), 0);
+    ASSERT_TRUE(sync(*ours));
+    EXPECT_EQ(get(*ours, "key"), "old");
+    ASSERT_TRUE(setNow(*ours, "key", "new"));
+    EXPECT_EQ(onDisk(),
+              PropertyList::dictionary(
+                  {{"a", PropertyList::array({PropertyList::integer(1), PropertyList::string("x"),
+                                              PropertyList::dictionary({{"b", PropertyList::real(2.5)}})})},
+                   {"key", PropertyList::string("new")}}));
+  }
+  EXPECT_TRUE(log.entries().empty());
+}
+
+// ---- what others do meanwhile
+// -------------------------------------------------------------------------------
+
+TEST_F(FilePreferencesTest, AReplacedFileIsSeenEvenWithTheSameSizeAndTime) {
+  home.write(kDomain, binary(textDictionary("key", "one")));
+  struct stat facts;
+  ASSERT_EQ(::stat(file.c_str(), &facts), 0);
+  const timespec old[2] = {{1'000'000, 0}, {1'000'000, 0}};
+  ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), old, 0), 0);
+  ASSERT_TRUE(sync(*ours));
+  ASSERT_EQ(get(*ours, "key"), "one");
+  // The old inode's number is free again for the new file, unless the store keeps it taken.
+  fs::remove(file);
+  home.write(kDomain, binary(textDictionary("key", "two")));
+  ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), old, 0), 0);
+  EXPECT_EQ(get(*ours, "key"), "one");
+  ASSERT_TRUE(sync(*ours));
+  EXPECT_EQ(get(*ours, "key"), "two");
+}
+
+TEST_F(FilePreferencesTest, AFileSoYoungThatItsTimeMayStandStillIsReadAgain) {
+  home.write(kDomain, binary(textDictionary("key", "one")));
+  const timespec future[2] = {{4'000'000'000, 0}, {4'000'000'000, 0}};
+  ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), future, 0), 0);
+  ASSERT_TRUE(sync(*ours));
+  ASSERT_EQ(get(*ours, "key"), "one");
+  home.write(kDomain, binary(textDictionary("key", "two")));
+  ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), future, 0), 0);
+  ASSERT_TRUE(sync(*ours));
+  EXPECT_EQ(get(*ours, "key"), "two");
+}
+
+TEST_F(FilePreferencesTest, ASettledFileIsNotReadAgain) {
+  ASSERT_TRUE(setNow(*ours, "key", "one"));
+  SystemCalls calls;
+  calls.failOpen = EIO;  // would be noticed
+  for (int i = 0; i < 3; ++i) {
+    EXPECT_TRUE(sync(*ours));
+    EXPECT_EQ(get(*ours, "key"), "one");
+  }
+  EXPECT_TRUE(setNow(*ours, "key", "two"));
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(FilePreferencesTest, ARemovedFileIsAnEmptyDomain) {
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  fs::remove_all(home.home() / "Library");
+  ASSERT_TRUE(sync(*ours));
+  EXPECT_EQ(get(*ours, "key"), "(none)");
+  ASSERT_TRUE(setNow(*ours, "another", "value"));
+  EXPECT_EQ(onDisk(), textDictionary("another", "value"));
+}
+
+TEST_F(FilePreferencesTest, AWriterThatKeepsTheLockIsWaitedForOnlySoLong) {
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  const auto hasty = home.open(20ms);
+  UniqueFd lock(::open((home.folder() / ".brenvik-preferences.lock").c_str(), O_RDWR | O_CLOEXEC));
+  ASSERT_EQ(::flock(lock.get(), LOCK_EX), 0);
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_FALSE(setNow(*hasty, "key", "new"));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, 10s);
+  EXPECT_EQ(onlyLine(), line("lock: another writer does not let go of the lock"));
+  EXPECT_EQ(get(*hasty, "key"), "old") << "reading needs no lock";
+  lock.reset();
+  EXPECT_TRUE(setNow(*hasty, "key", "new"));
+}
+
+TEST_F(FilePreferencesTest, ALockFileThatWasRemovedIsMadeAnew) {
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  fs::remove(home.folder() / ".brenvik-preferences.lock");
+  EXPECT_TRUE(setNow(*ours, "key", "new"));
+  EXPECT_EQ(modeOf(home.folder() / ".brenvik-preferences.lock"), 0600u);
+}
+
+TEST_F(FilePreferencesTest, ManyDomainsCostOnlySoManyDescriptors) {
+  const auto descriptors = [] {
+    return std::distance(fs::directory_iterator("/proc/self/fd"), fs::directory_iterator());
+  };
+  const auto before = descriptors();
+  for (int i = 0; i < 60; ++i) {
+    const std::string domain = "d" + std::to_string(i);
+    ours->setValue("key", PropertyList::integer(i), domain, kUser, kHost);
+    ASSERT_TRUE(ours->synchronize(domain, kUser, kHost));
+  }
+  EXPECT_LE(descriptors() - before, 16);
+  for (int i = 0; i < 60; ++i) {
+    EXPECT_EQ(ours->copyValue("key", "d" + std::to_string(i), kUser, kHost).asInteger(), i);
+  }
+  // What waits to be stored is never forgotten.
+  set(*ours, "waiting", "still");
+  for (int i = 0; i < 60; ++i) ours->copyValue("key", "d" + std::to_string(i), kUser, kHost);
+  EXPECT_EQ(get(*ours, "waiting"), "still");
+  ours.reset();
+  EXPECT_EQ(descriptors(), before);
+}
+
+TEST_F(FilePreferencesTest, SeveralThreadsShareAStore) {
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([this, t] {
+      const std::string domain = t % 2 == 0 ? kDomain : "com.example.second";
+      for (int i = 0; i < 10; ++i) {
+        ours->setValue(std::to_string(t), PropertyList::integer(i), domain, kUser, kHost);
+        EXPECT_TRUE(ours->synchronize(domain, kUser, kHost));
+        EXPECT_EQ(ours->copyValue(std::to_string(t), domain, kUser, kHost).asInteger(), i);
+        ours->flushCachesForAnyUser(&domain);
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  const auto other = home.open();
+  for (int t = 0; t < 4; ++t) {
+    const std::string domain = t % 2 == 0 ? kDomain : "com.example.second";
+    EXPECT_EQ(other->copyValue(std::to_string(t), domain, kUser, kHost).asInteger(), 9);
+  }
+}
+
+// ---- damage
+// -------------------------------------------------------------------------------------------------
+
+class DamagedPreferencesTest : public FilePreferencesTest {
+ protected:
+  // A set on the damaged file: it is stored in a new one, and the old one stands beside it under the new
+  // name.
+  void expectMovedAside(const std::string& reason, int number = 1) {
+    EXPECT_TRUE(setNow(*ours, "key", "value"));
+    const std::string aside = "com.example.files.plist.damaged-" + std::to_string(number);
+    EXPECT_EQ(onlyLine(), line("damaged (" + reason + "), moved aside to " + aside));
+    EXPECT_EQ(onDisk(), textDictionary("key", "value"));
+  }
+  fs::path aside(int number = 1) const { return file.string() + ".damaged-" + std::to_string(number); }
+};
+
+TEST_F(DamagedPreferencesTest, ADamagedFileIsMovedAsideAndNeverWrittenOver) {
+  std::string good = binary(textDictionary("key", "old"));
+  const std::string damaged[] = {"", "garbage", good.substr(0, good.size() - 1),
+                                 "bplist00" + std::string(40, '\xFF'),
+                                 "<plist><dict><key>a</key></dict></plist>"};
+  int number = 0;
+  for (const std::string& bytes : damaged) {
+    home.write(kDomain, bytes);
+    expectMovedAside("not a property list", ++number);
+    EXPECT_EQ(TestHome::read(aside(number)), bytes);
+  }
+  home.write(kDomain, binary(PropertyList::array({})));
+  expectMovedAside("not a dictionary", ++number);
+}
+
+TEST_F(DamagedPreferencesTest, AReaderMovesItAsideOnceAndFindsNoValues) {
+  home.write(kDomain, "garbage");
+  EXPECT_EQ(get(*ours, "key"), "(none)");
+  EXPECT_EQ(onlyLine(),
+            line("damaged (not a property list), moved aside to com.example.files.plist.damaged-1"));
+  EXPECT_TRUE(sync(*ours));
+  EXPECT_EQ(get(*ours, "key"), "(none)");
+  EXPECT_TRUE(log.entries().empty());
+  EXPECT_EQ(TestHome::read(aside()), "garbage");
+}
+
+TEST_F(DamagedPreferencesTest, ATooDeepFileIsMovedAside) {
+  std::string xml = "<plist version=\"1.0\"><dict><key>a</key>";
+  for (int i = 0; i < 100'000; ++i) xml += "<array>";
+  for (int i = 0; i < 100'000; ++i) xml += "</array>";
+  home.write(kDomain, xml + "</dict></plist>");
+  expectMovedAside("not a property list");
+}
+
+TEST_F(DamagedPreferencesTest, AHugeFileIsMovedAsideUnread) {
+  home.write(kDomain, "");
+  ASSERT_EQ(::truncate(file.c_str(), off_t{1} << 40), 0);
+  expectMovedAside("too large");
+  EXPECT_EQ(fs::file_size(aside()), std::uintmax_t{1} << 40);
+}
+
+TEST_F(DamagedPreferencesTest, WhatIsNoFileIsMovedAsideAndNothingWaitsForIt) {
+  fs::create_directories(file / "inside");
+  expectMovedAside("not a regular file");
+  EXPECT_TRUE(fs::exists(aside() / "inside"));
+
+  fs::remove(file);
+  ASSERT_EQ(::mkfifo(file.c_str(), 0600), 0);
+  expectMovedAside("not a regular file", 2);
+
+  fs::remove(file);
+  fs::create_symlink(file, file);
+  expectMovedAside("Too many levels of symbolic links", 3);
+  EXPECT_TRUE(fs::is_symlink(aside(3)));
+
+  fs::remove(file);
+  const UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  file.string().copy(address.sun_path, sizeof address.sun_path - 1);
+  ASSERT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+  expectMovedAside("No such device or address", 4);
+}
+
+TEST_F(DamagedPreferencesTest, AnUnreadableFileIsMovedAside) {
+  home.write(kDomain, binary(textDictionary("key", "old")));
+  {
+    SystemCalls calls;
+    calls.failOpen = EACCES;
+    expectMovedAside("Permission denied");
+  }
+  EXPECT_EQ(TestHome::read(aside()), binary(textDictionary("key", "old")));
+}
+
+TEST_F(DamagedPreferencesTest, ALackOfDescriptorsOrMemoryIsNoDamage) {
+  home.write(kDomain, binary(textDictionary("key", "old")));
+  for (const int error : {EMFILE, ENFILE, ENOMEM}) {
+    SystemCalls calls;
+    calls.failOpen = error;
+    EXPECT_FALSE(setNow(*ours, "key", "new"));
+    EXPECT_EQ(log.entries().size(), 1u);
+    log.clear();
+    EXPECT_EQ(get(*ours, "key"), "(none)");
+    log.clear();
+  }
+  ASSERT_TRUE(sync(*ours));
+  EXPECT_EQ(get(*ours, "key"), "old") << "when it is over, all is as it was";
+  EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+}
+
+TEST_F(DamagedPreferencesTest, WhatCannotBeMovedAsideIsNotWrittenOver) {
+  home.write(kDomain, "garbage");
+  {
+    SystemCalls calls;
+    calls.failRenameFlags = EACCES;
+    EXPECT_FALSE(setNow(*ours, "key", "value"));
+    EXPECT_EQ(onlyLine(),
+              line("damaged (not a property list) and cannot be moved aside (Permission denied); nothing is "
+                   "stored there"));
+    EXPECT_EQ(TestHome::read(file), "garbage");
+    // File systems that know no flags of rename: looked at first, then renamed.
+    calls.failRenameFlags = EINVAL;
+    std::ofstream(aside()) << "an earlier one";
+    expectMovedAside("not a property list", 2);
+  }
+  EXPECT_EQ(TestHome::read(aside(2)), "garbage");
+  EXPECT_EQ(TestHome::read(aside(1)), "an earlier one");
+}
+
+TEST_F(DamagedPreferencesTest, ADamagedFileOfTheLongestNameIsMovedAsideToo) {
+  const std::string longest(NAME_MAX - 6, 'd');
+  home.write(longest, "garbage");
+  ours->setValue("key", PropertyList::boolean(true), longest, kUser, kHost);
+  EXPECT_TRUE(ours->synchronize(longest, kUser, kHost));
+  EXPECT_EQ(home.files().size(), 2u);
+}
+
+TEST_F(DamagedPreferencesTest, ADanglingLinkIsAnEmptyDomain) {
+  fs::create_directories(home.folder());
+  fs::create_symlink("nowhere", file);
+  EXPECT_EQ(get(*ours, "key"), "(none)");
+  EXPECT_TRUE(setNow(*ours, "key", "value"));
+  EXPECT_FALSE(fs::is_symlink(file));
+  EXPECT_TRUE(log.entries().empty());
+}
+
+// ---- a full disk
+// --------------------------------------------------------------------------------------------
+
+// In a mount namespace of its own, so in a process of its own. The exit status says what went wrong; 77: not
+// permitted here.
+int fillDisk(const TestHome& home) {
+  constexpr int kNotPermitted = 77;
+  if (::unshare(CLONE_NEWNS) != 0 || ::mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+      ::mount("none", home.home().c_str(), "tmpfs", 0, "size=256k,mode=0700") != 0) {
+    return kNotPermitted;
+  }
+  RecordingLog log;
+  const auto store = home.open();
+  const auto set = [&store](std::string_view text) {
+    store->setValue("key", PropertyList::string(text), "d", kUser, kHost);
+    return store->synchronize("d", kUser, kHost);
+  };
+  if (!set("fits") || !log.entries().empty()) return 1;
+  const std::string before = TestHome::read(home.file("d"));
+  if (set(std::string(400'000, 'x'))) return 2;
+  if (log.entries().size() != 1 ||
+      log.entries()[0] !=
+          RecordingLog::unifiedLine(LogLevel::error, "Preferences " + home.file("d").string() +
+                                                         ": write: No space left on device")) {
+    return 3;
+  }
+  if (TestHome::read(home.file("d")) != before) return 4;
+  if (home.files() != std::vector<std::string>{"d.plist"}) return 5;
+  if (store->copyValue("key", "d", kUser, kHost).asString() != "fits") return 6;
+  return set("fits again") ? 0 : 7;
+}
+
+TEST_F(FilePreferencesTest, OnAFullDiskASetFailsAndTheOldFileStands) {
+  const pid_t child = ::fork();
+  if (child == 0) ::_exit(fillDisk(home));
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  if (WEXITSTATUS(status) == 77) GTEST_SKIP() << "no mount namespace permitted here";
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+}
+
+}  // namespace
+}  // namespace brenvik
