@@ -1,0 +1,93 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "helper/core/EntryPoint.h"
+
+#include <gtest/gtest.h>
+
+#include "helper/core/UnbuiltRoutines.h"
+#include "helper/requests/RequestTable.h"
+#include "platform/baseband/fakes/FakeBaseband.h"
+#include "platform/ipc/fakes/FakePorts.h"
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/runloop/fakes/ManualRunLoop.h"
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+
+class EntryPointTest : public testing::Test {
+ protected:
+  // A client checks in and dies, then time passes until the server stops.
+  void letTheIdleRuleEndIt() {
+    loop.whenRun = [this] {
+      baseband.record += "run ";
+      PortName port = kNullPort;
+      const PortName service = sources.routineSources.at(0)->port;
+      ASSERT_EQ(BVMobileHelperCheckIn(registry, platform, service, ports.adoptSendRight(), &port, {}), 0);
+      sources.deathWatches.at(0)->tellDeath();
+      loop.whenRun = [this] { clock.advance(10s); };
+    };
+  }
+
+  ManualClock clock;
+  ManualRunLoop loop{clock};
+  FakePortSpace ports;
+  FakeBootstrap bootstrap{ports};
+  FakePortSources sources;
+  PortServerRegistry registry;
+  ServerPlatform platform{ports, bootstrap, sources, loop, [](const char*, const AuditToken&) { return true; },
+                          registry};
+  UnbuiltRoutines routines;
+  RequestTable requests{routines};
+  FakeBasebandLibrary baseband;
+  RecordingLog log;
+};
+
+TEST_F(EntryPointTest, ServesUntilTheIdleRuleEndsItAndExitsWith0) {
+  baseband.hosts = false;
+  letTheIdleRuleEndIt();
+  EXPECT_EQ(runHelper(baseband, platform, requests), 0);
+  EXPECT_EQ(bootstrap.name, "com.norvale.brenvik.mobile-helper");
+  EXPECT_EQ(baseband.record, "canHost run ");
+  EXPECT_EQ(registry.size(), 0U);
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(EntryPointTest, AHostedServerIsStartedBeforeAndStoppedAfterTheServiceAndAskedAtEachTick) {
+  baseband.busy = true;
+  letTheIdleRuleEndIt();
+  const auto first = loop.whenRun;
+  loop.whenRun = [&, first] {
+    first();
+    const auto tick = loop.whenRun;
+    loop.whenRun = [&, tick] {
+      if (baseband.busyQuestions == 2) baseband.busy = false;
+      tick();
+    };
+  };
+  EXPECT_EQ(runHelper(baseband, platform, requests), 0);
+  EXPECT_EQ(baseband.busyQuestions, 3);
+  EXPECT_EQ(baseband.record, "canHost create start run stop release ");
+}
+
+TEST_F(EntryPointTest, ALibraryThatMakesNoServerHostsNone) {
+  baseband.makesServer = false;
+  letTheIdleRuleEndIt();
+  EXPECT_EQ(runHelper(baseband, platform, requests), 0);
+  EXPECT_EQ(baseband.record, "canHost create run ");
+}
+
+TEST_F(EntryPointTest, AServiceThatCannotBeSetUpIsLoggedTwiceAndExitsWith1AfterStoppingTheHostedServer) {
+  bootstrap.refuseWith = kern::noAccess;
+  EXPECT_EQ(runHelper(baseband, platform, requests), 1);
+  EXPECT_EQ(log.entries(),
+            (std::vector{
+                RecordingLog::unifiedLine(LogLevel::error, "unable to create server objects - out of resources"),
+                RecordingLog::unifiedLine(LogLevel::error, "unable to startup BrenvikMobileHelper server")}));
+  EXPECT_EQ(baseband.record, "canHost create start stop release ");
+  EXPECT_EQ(loop.runs, 0);
+}
+
+}  // namespace
+}  // namespace brenvik

@@ -1,0 +1,44 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include "helper/core/UnbuiltRoutines.h"
+#include "helper/mobile/RadioLogging.h"
+#include "helper/preferences/PreferenceTransfer.h"
+
+namespace brenvik {
+
+// Hands each server routine to the area that owns it.
+class HelperRoutines final : public UnbuiltRoutines {
+ public:
+  // The areas; each outlives the routines.
+  struct Areas {
+    PreferenceTransfer& preferences;
+    RadioLogging& radioLogging;
+  };
+  explicit HelperRoutines(const Areas& areas) noexcept : areas_(areas) {}
+
+  KernelReturn server_BVMobileHelperSetPreferenceValue(PortName port, char* domain, char* key, const void* value,
+                                                       std::uint32_t length) override {
+    return areas_.preferences.setPreferenceValue(port, domain, key, value, length);
+  }
+  KernelReturn server_BVMobileHelperCopyPreferenceValue(PortName port, char* domain, char* key,
+                                                        OutOfLinePayload* value) override {
+    return areas_.preferences.copyPreferenceValue(port, domain, key, value);
+  }
+  KernelReturn server_BVMobileHelperCopyAppPreferenceValue(PortName port, char* domain, char* key,
+                                                           OutOfLinePayload* value) override {
+    return areas_.preferences.copyAppPreferenceValue(port, domain, key, value);
+  }
+  KernelReturn server_BVMobileHelperLoadPlistFile(PortName port, char* path, OutOfLinePayload* contents) override {
+    return areas_.preferences.loadPlistFile(port, path, contents);
+  }
+  KernelReturn server_BVMobileHelperEnableRadioManagerLogs(PortName port, std::int32_t enable) override {
+    return areas_.radioLogging.BVMobileHelperEnableRadioManagerLogs(port, enable);
+  }
+
+ private:
+  const Areas areas_;
+};
+
+}  // namespace brenvik

@@ -1,0 +1,90 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+// The composition root: the only file of the helper that names a Linux class.
+
+#include <sys/resource.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <csignal>
+#include <cstdio>
+
+#include "helper/core/EntryPoint.h"
+#include "helper/core/HelperRoutines.h"
+#include "helper/requests/RequestTable.h"
+#include "platform/accounts/linux/PasswordDatabase.h"
+#include "platform/baseband/linux/LoadedBasebandLibrary.h"
+#include "platform/ipc/linux/SystemBootstrap.h"
+#include "platform/ipc/linux/SystemPortSources.h"
+#include "platform/log/linux/SystemLog.h"
+#include "platform/preferences/linux/FilePreferences.h"
+#include "platform/radio/linux/ModemManagerLogs.h"
+#include "platform/runloop/linux/SystemQueues.h"
+#include "platform/security/linux/EntitlementFiles.h"
+
+namespace brenvik {
+namespace {
+
+// A client takes four descriptors; the usual limit of 1,024 would be 250 of them.
+constexpr rlim_t kDescriptors = 8192;
+
+void prepareProcess() noexcept {
+  rlimit descriptors{};
+  if (::getrlimit(RLIMIT_NOFILE, &descriptors) == 0 && descriptors.rlim_cur < kDescriptors) {
+    descriptors.rlim_cur = std::min(kDescriptors, descriptors.rlim_max);
+    (void)::setrlimit(RLIMIT_NOFILE, &descriptors);
+  }
+  // A reader of standard error that went away must not end the process.
+  (void)std::signal(SIGPIPE, SIG_IGN);
+  (void)::umask(022);
+}
+
+int run() {
+  prepareProcess();
+  SystemLog log("BrenvikMobileHelper");
+  setLogSink(&log);
+
+  const auto loop = SystemRunLoop::make();
+  if (loop == nullptr) {
+    logUnified(LogLevel::error, "unable to startup BrenvikMobileHelper server");
+    return 1;
+  }
+  SystemQueues queues(*loop);
+  PasswordDatabase accounts;
+  EntitlementFiles security(accounts);
+
+  SystemPortSpace ports;
+  SystemRegions regions;
+  SystemPortSources sources(ports, regions);
+  SystemBootstrap bootstrap(ports, BRENVIK_BOOTSTRAP_DIRECTORY);
+  LoadedBasebandLibrary baseband;
+
+  FilePreferences preferences;
+  PreferenceTransfer preferenceTransfer(preferences, regions, [](const char*) { return PropertyList(); });
+  ModemManagerLogs radio(queues);
+  RadioLogging radioLogging(radio);
+
+  HelperRoutines routines({.preferences = preferenceTransfer, .radioLogging = radioLogging});
+  const RequestTable requests(routines);
+  const ServerPlatform platform{ports, bootstrap, sources, *loop,
+                                [&](const char* entitlement, const AuditToken& caller) {
+                                  const auto task = security.makeTask(caller);
+                                  return task != nullptr &&
+                                         task->copyEntitlement(entitlement).value.asBoolean().value_or(false);
+                                }};
+  const int status = runHelper(baseband, platform, requests);
+  setLogSink(nullptr);
+  return status;
+}
+
+}  // namespace
+}  // namespace brenvik
+
+int main() {
+  try {
+    return brenvik::run();
+  } catch (const std::exception& error) {
+    std::fprintf(stderr, "<3>unable to startup BrenvikMobileHelper server: %s\n", error.what());
+    return 1;
+  }
+}
