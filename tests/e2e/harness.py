@@ -245,7 +245,7 @@ class HelperTest(unittest.TestCase):
         entitle()
         self.prepare()
         self.daemon = Daemon(activated=self.activated)
-        self.addCleanup(self.daemon.stop)
+        self.addCleanup(lambda: self.daemon.stop())  # whichever daemon the test has by then
 
     def prepare(self):
         """For what must be in place before the daemon starts."""

@@ -156,7 +156,11 @@ def check_status(request, reply, ndr=NDR):
 def connect(path=None, timeout=10):
     sock = socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET)
     sock.settimeout(timeout)
-    sock.connect(path or f"{BOOTSTRAP}/{SERVICE}")
+    try:
+        sock.connect(str(path or f"{BOOTSTRAP}/{SERVICE}"))
+    except OSError:
+        sock.close()
+        raise
     return Channel(sock)
 
 

@@ -373,6 +373,12 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
 
   void serve(UniqueFd connection) {
     if (!spare_.isValid()) spare_ = openSpare();
+    // A connection made before the listening socket asked for credentials (a client that started this process)
+    // has not taken that over on every kernel.
+    const int on = 1;
+    if (trailer_ == WantTrailer::yes) {
+      (void)::setsockopt(connection.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on);
+    }
     ucred peer{};
     socklen_t size = sizeof peer;
     (void)::getsockopt(connection.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size);

@@ -1,5 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+// The place of the log call is sent, not this file's.
+#define SD_JOURNAL_SUPPRESS_LOCATION
+
 #include "platform/log/linux/SystemLog.h"
 
 #include <sys/socket.h>

@@ -1,0 +1,223 @@
+# SPDX-License-Identifier: Apache-2.0
+# SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+"""Start, refusal, idle exit: the life of the real process."""
+import os
+import pathlib
+import socket
+import subprocess
+import sys
+import time
+import unittest
+
+import wire
+from harness import (ERROR, SOCKET, Daemon, HelperTest, Logs, as_account, entitle, eventually,
+                     listen, main)
+
+IDLE = 10.0  # seconds
+
+
+class StandingAlone(HelperTest):
+    def test_the_socket_file_is_there_for_everybody(self):
+        self.assertEqual(SOCKET.stat().st_mode & 0o7777, 0o666)
+
+    def test_a_second_instance_says_why_and_exits_with_1(self):
+        second = Daemon(wait=False)
+        self.addCleanup(second.stop)
+        self.assertEqual(second.wait(), 1)
+        self.logs.wait_for("unified", ERROR, f"another process already serves {SOCKET}")
+        self.logs.wait_for("unified", ERROR, "unable to create server objects - out of resources")
+        self.logs.wait_for("unified", ERROR, "unable to startup BrenvikMobileHelper server")
+        self.client()  # the first is not disturbed
+
+    def test_a_killed_instance_leaves_a_stale_file_that_the_next_replaces(self):
+        self.daemon.process.kill()
+        self.daemon.wait()
+        self.assertTrue(SOCKET.exists())
+        self.daemon.stop()
+        self.daemon = Daemon()
+        self.client()
+
+    def test_no_client_ever_checks_in_and_the_process_keeps_running_without_waking_up(self):
+        connection = wire.connect()  # a connection is not a client
+        self.addCleanup(connection.close)
+        time.sleep(0.2)
+        task = pathlib.Path(f"/proc/{self.daemon.pid}/status")
+        wakeups = [line for line in task.read_text().splitlines() if "ctxt_switches" in line]
+        time.sleep(IDLE + 2)
+        self.assertTrue(self.daemon.running())
+        self.assertEqual([line for line in task.read_text().splitlines() if "ctxt_switches" in line], wakeups)
+
+    def test_the_process_leaves_10_seconds_after_its_last_client_with_status_0_and_takes_its_file_along(self):
+        first, second = wire.Client(), wire.Client()
+        first.close()
+        time.sleep(2)  # the countdown must not have started
+        second.close()
+        closed = time.monotonic()
+        self.assertEqual(self.daemon.wait(), 0)
+        waited = time.monotonic() - closed
+        self.assertGreaterEqual(waited, IDLE - 0.1)
+        self.assertLess(waited, IDLE + 3)
+        self.assertFalse(SOCKET.exists())
+
+    def test_a_check_in_during_the_countdown_starts_it_afresh(self):
+        wire.Client().close()
+        time.sleep(6)
+        client = wire.Client()
+        time.sleep(6)
+        self.assertTrue(self.daemon.running(), "the first countdown was cancelled")
+        client.close()
+        closed = time.monotonic()
+        self.assertEqual(self.daemon.wait(), 0)
+        self.assertGreaterEqual(time.monotonic() - closed, IDLE - 0.1)
+
+    def test_a_connection_that_never_checked_in_does_not_keep_the_process_and_gets_end_of_file(self):
+        idle = wire.connect()
+        self.addCleanup(idle.close)
+        self.client().close()
+        self.assertEqual(self.daemon.wait(), 0)
+        with self.assertRaises(wire.Closed):
+            idle.receive()
+
+    def test_a_refused_caller_does_not_touch_the_countdown(self):
+        wire.Client().close()
+        closed = time.monotonic()
+        for _ in range(4):
+            time.sleep(2)
+            self.assertEqual(as_account("stranger", refused_with), 35)
+        self.assertEqual(self.daemon.wait(), 0)
+        self.assertLess(time.monotonic() - closed, IDLE + 3)
+
+
+def refused_with():
+    try:
+        wire.Client().close()
+        return 0
+    except wire.Status as status:
+        return status.code
+
+
+class Admission(HelperTest):
+    def test_an_entitled_caller_is_admitted_and_another_account_is_refused_with_35(self):
+        self.client()
+        self.assertEqual(as_account("stranger", refused_with), 35)
+
+    def test_an_entitlement_that_is_not_boolean_true_is_refused(self):
+        for value in ("true", 1, False, {"a": True}):
+            entitle(value=value)
+            self.assertEqual(refused_with(), 35, value)
+
+    def test_a_file_for_another_account_admits_that_account_alone(self):
+        entitle(user="telephony")
+        self.assertEqual(refused_with(), 35)
+        self.assertEqual(as_account("telephony", refused_with), 0)
+
+    def test_a_file_that_others_may_write_is_passed_over_and_reported(self):
+        path = entitle()
+        path.chmod(0o666)
+        self.assertEqual(refused_with(), 35)
+        eventually(lambda: any(level == ERROR and str(path) in text for channel, level, text in self.logs.lines),
+                   what="an error line that names the file")
+
+    def test_a_grant_is_kept_for_the_life_of_the_process_and_a_refusal_is_not(self):
+        path = entitle()
+        first = wire.Client()
+        self.addCleanup(first.close)
+        path.unlink()
+        second = wire.Client()
+        self.addCleanup(second.close)
+        child = "import sys; sys.path.insert(0, '.'); import test_lifecycle; sys.exit(test_lifecycle.refused_with())"
+        command = [sys.executable, "-c", child]
+        self.assertEqual(subprocess.run(command, check=False).returncode, 35)
+        entitle()
+        self.assertEqual(subprocess.run(command, check=False).returncode, 0)
+
+    def test_the_caller_whose_port_is_already_dead_gets_5(self):
+        ours, theirs = socket.socketpair(socket.AF_UNIX, socket.SOCK_SEQPACKET)
+        ours.close()
+        service = wire.connect()
+        self.addCleanup(service.close)
+        self.assertEqual(service.status(wire.check_in_message(), [theirs.fileno()]), 5)
+        theirs.close()
+        # The process noticed the death, and left the countdown running.
+        self.assertEqual(self.daemon.wait(), 0)
+
+    def test_two_check_ins_of_one_process_are_independent(self):
+        first, second = self.client(), self.client()
+        first.life.close()
+        with self.assertRaises(wire.Closed):
+            first.channel.receive()
+        self.assertEqual(second.status("EnableRadioManagerLogs", (1).to_bytes(4, "little")), 0)
+
+
+class Activated(HelperTest):
+    activated = True
+
+    def test_the_manager_keeps_the_socket_file_and_a_late_client_waits_for_the_next_start(self):
+        self.client().close()
+        self.assertEqual(self.daemon.wait(), 0)
+        self.assertTrue(SOCKET.exists())
+        late = wire.connect()
+        self.addCleanup(late.close)
+        late.send(*check_in())
+        self.daemon = Daemon(activated=True, listening=self.daemon.listening)
+        reply, fds = late.receive()
+        self.assertEqual(len(reply), 40)
+        for fd in fds:
+            os.close(fd)
+
+    def test_a_message_sent_before_the_process_started_has_its_senders_credentials(self):
+        listening = listen("/run/brenvik/bootstrap/early")
+        early = wire.connect("/run/brenvik/bootstrap/early")
+        self.addCleanup(early.close)
+        early.send(*check_in())
+        daemon = Daemon(activated=True, listening=listening)
+        self.addCleanup(daemon.stop)
+        reply, fds = early.receive()
+        self.assertEqual(len(reply), 40)
+        for fd in fds:
+            os.close(fd)
+
+    def test_nothing_is_loaded_at_start_that_the_first_check_in_does_not_need(self):
+        self.client()
+        loaded = self.daemon.maps()
+        for library in ("curl", "sqlite", "crypto.so", "archive", "unistring", "expat", "icu"):
+            self.assertNotIn(library, loaded)
+
+
+LIVES = []
+
+
+def check_in():
+    """A check-in whose port lives as long as this module."""
+    ours, theirs = socket.socketpair(socket.AF_UNIX, socket.SOCK_SEQPACKET)
+    LIVES.extend((ours, theirs))
+    return wire.check_in_message(), [theirs.fileno()]
+
+
+class WithoutJournal(unittest.TestCase):
+    def test_lines_go_to_standard_error_with_their_priority(self):
+        logs = Logs()
+        logs.close()  # neither socket is there now
+        first = Daemon()
+        self.addCleanup(first.stop)
+        second = Daemon(wait=False)
+        self.assertEqual(second.wait(), 1)
+        self.assertIn(b"<3>unable to startup BrenvikMobileHelper server\n", second.stderr)
+        second.stop()
+
+
+class JournalFields(HelperTest):
+    def test_entries_carry_identifier_and_place(self):
+        second = Daemon(wait=False)
+        self.addCleanup(second.stop)
+        second.wait()
+        self.logs.wait_for("unified", ERROR, "unable to startup BrenvikMobileHelper server")
+        entry = self.logs.entries[-1]
+        self.assertEqual(entry["SYSLOG_IDENTIFIER"], "BrenvikMobileHelper")
+        self.assertTrue(entry["CODE_FILE"].endswith("helper/core/EntryPoint.cpp"))
+        self.assertTrue(entry["CODE_LINE"].isdigit())
+        self.assertEqual(entry["CODE_FUNC"], "runHelper")
+
+
+if __name__ == "__main__":
+    main()
