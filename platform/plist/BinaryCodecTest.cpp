@@ -59,7 +59,8 @@ std::string writtenAsBinary(const PropertyList& value) {
 PropertyList bytes(std::string_view content) { return PropertyList::data(std::as_bytes(std::span(content))); }
 
 #ifdef __SANITIZE_ADDRESS__
-constexpr long kHeldBack = 64 * 1024;  // freed memory that AddressSanitizer keeps from being used again, in KiB
+constexpr long kHeldBack =
+    64 * 1024;  // freed memory that AddressSanitizer keeps from being used again, in KiB
 #else
 constexpr long kHeldBack = 0;
 #endif
