@@ -21,7 +21,8 @@ struct Ratio {
   double most;
 };
 
-// Runs the registered benchmarks and prints the ratio of their median times; exit status 1 when one is above
+// Runs the registered benchmarks and prints the ratio of their median times (of the processor, or of the wall
+// for a benchmark with UseRealTime()); exit status 1 when one is above
 // its limit or was not measured. Repetitions are taken in turns, so that a slow minute of the machine meets
 // both sides.
 inline int runAndCompare(int argc, char** argv, const std::vector<Ratio>& ratios) {
@@ -31,7 +32,9 @@ inline int runAndCompare(int argc, char** argv, const std::vector<Ratio>& ratios
     void ReportRuns(const std::vector<Run>& runs) override {
       for (const Run& run : runs) {
         if (run.run_type == Run::RT_Iteration && !run.error_occurred) {
-          times[run.run_name.function_name].push_back(run.GetAdjustedRealTime());
+          const bool onTheWall = !run.run_name.time_type.empty();
+          times[run.run_name.function_name].push_back(onTheWall ? run.GetAdjustedRealTime()
+                                                                : run.GetAdjustedCPUTime());
         }
       }
       // One line a benchmark is enough: the median of its repetitions.

@@ -195,12 +195,56 @@ char* decodeBase64(std::string_view text, char* to) noexcept {
   return to;
 }
 
-// True for each byte at which plain text stops to be copied as it is.
-constexpr std::array<bool, 256> kStopsText = [] {
-  std::array<bool, 256> stops{};
-  for (const char c : {'<', '&', '>', '\r'}) stops[static_cast<unsigned char>(c)] = true;
-  return stops;
-}();
+enum class Element : std::uint8_t {
+  array,
+  data,
+  date,
+  dictionary,
+  no,
+  integer,
+  key,
+  real,
+  string,
+  yes,
+  unknown
+};
+
+struct Spelling {
+  std::string_view name;
+  std::string_view endTag;
+};
+constexpr Spelling kSpellings[] = {{"array", "</array>"}, {"data", "</data>"},   {"date", "</date>"},
+                                   {"dict", "</dict>"},   {"false", "</false>"}, {"integer", "</integer>"},
+                                   {"key", "</key>"},     {"real", "</real>"},   {"string", "</string>"},
+                                   {"true", "</true>"}};
+constexpr const Spelling& spellingOf(Element element) noexcept {
+  return kSpellings[static_cast<std::size_t>(element)];
+}
+
+constexpr std::uint64_t kOnes = 0x0101010101010101ULL;
+constexpr std::uint64_t kTops = 0x8080808080808080ULL;
+
+// Where plain text stops to be copied as it is: at < & > or a carriage return.
+bool stopsText(char c) noexcept { return c == '<' || c == '&' || c == '>' || c == '\r'; }
+
+const char* endOfPlainText(const char* at, const char* end) noexcept {
+  auto zeroIn = [](std::uint64_t bytes) { return (bytes - kOnes) & ~bytes; };
+  // Eight bytes at a time up to those among which there is a stop. (There may be none after all.)
+  while (end - at >= 8) {
+    std::uint64_t word;
+    std::memcpy(&word, at, sizeof word);
+    const std::uint64_t angle = zeroIn((word | kOnes * 2) ^ kOnes * '>');
+    if (((angle | zeroIn(word ^ kOnes * '&') | zeroIn(word ^ kOnes * '\r')) & kTops) == 0) {
+      at += 8;
+      continue;
+    }
+    for (int i = 0; i < 8; ++i, ++at) {
+      if (stopsText(*at)) return at;
+    }
+  }
+  while (at != end && !stopsText(*at)) ++at;
+  return at;
+}
 
 class Reader {
  public:
@@ -249,16 +293,18 @@ class Reader {
   bool documentType();
   bool rootTag();
   bool endTag(std::string_view name);
+  bool endTag(Element element);
+  Element elementName() noexcept;
   Form tagEnd();
   bool content();
   bool beginContainer(bool isDictionary);
   bool endContainer();
-  bool scalar(std::string_view name);
-  bool text(std::string_view name, std::string_view& value);
-  bool textWithMarkup(std::string_view name, std::string_view& value);
+  bool scalar(Element element);
+  bool text(Element element, std::string_view& value);
+  bool textWithMarkup(Element element, std::string_view& value);
   bool reference();
   void appendLines(std::string_view text);
-  bool textNode(Tag tag, std::string_view text, Node& node);
+  void textNode(std::string_view text, Node& node);
   bool dataNode(std::string_view text, Node& node);
   bool fits(const Node& root) const;
 
@@ -397,7 +443,49 @@ bool Reader::endTag(std::string_view name) {
   return take('>');
 }
 
+bool Reader::endTag(Element element) {
+  const Spelling& spelling = spellingOf(element);
+  return take(spelling.endTag) || endTag(spelling.name);  // the second for space within
+}
+
+// Behind "<"; the byte behind the name is for tagEnd() to judge.
+Element Reader::elementName() noexcept {
+  // Something must follow: the end of the root at least.
+  if (left() < 8) return Element::unknown;
+  Element candidate = Element::unknown;
+  switch (*cursor_) {
+    case 'a':
+      candidate = Element::array;
+      break;
+    case 'd':
+      candidate = cursor_[1] == 'i' ? Element::dictionary : cursor_[3] == 'a' ? Element::data : Element::date;
+      break;
+    case 'f':
+      candidate = Element::no;
+      break;
+    case 'i':
+      candidate = Element::integer;
+      break;
+    case 'k':
+      candidate = Element::key;
+      break;
+    case 'r':
+      candidate = Element::real;
+      break;
+    case 's':
+      candidate = Element::string;
+      break;
+    case 't':
+      candidate = Element::yes;
+      break;
+    default:
+      return Element::unknown;
+  }
+  return take(spellingOf(candidate).name) ? candidate : Element::unknown;
+}
+
 Reader::Form Reader::tagEnd() {
+  if (take('>')) return Form::open;
   space();
   if (take('>')) return Form::open;
   return take("/>") ? Form::empty : Form::wrong;
@@ -440,18 +528,16 @@ void Reader::appendLines(std::string_view text) {
 }
 
 // Character data up to and with the end tag. The view lies in the document or in scratch_.
-bool Reader::text(std::string_view name, std::string_view& value) {
+bool Reader::text(Element element, std::string_view& value) {
   const char* const from = cursor_;
-  const char* at = from;
-  while (at != end_ && !kStopsText[static_cast<unsigned char>(*at)]) ++at;
-  cursor_ = at;
-  value = {from, static_cast<std::size_t>(at - from)};
-  if (end_ - at >= 2 && at[0] == '<' && at[1] == '/') return endTag(name);
+  cursor_ = endOfPlainText(from, end_);
+  value = {from, static_cast<std::size_t>(cursor_ - from)};
+  if (left() >= 2 && cursor_[0] == '<' && cursor_[1] == '/') return endTag(element);
   scratch_.assign(value);
-  return textWithMarkup(name, value);
+  return textWithMarkup(element, value);
 }
 
-bool Reader::textWithMarkup(std::string_view name, std::string_view& value) {
+bool Reader::textWithMarkup(Element element, std::string_view& value) {
   while (cursor_ != end_) {
     switch (*cursor_) {
       case '&':
@@ -471,7 +557,7 @@ bool Reader::textWithMarkup(std::string_view name, std::string_view& value) {
       case '<':
         if (left() >= 2 && cursor_[1] == '/') {
           value = scratch_;
-          return endTag(name);
+          return endTag(element);
         }
         if (take("<![CDATA[")) {
           const char* const from = cursor_;
@@ -485,7 +571,7 @@ bool Reader::textWithMarkup(std::string_view name, std::string_view& value) {
         break;
       default: {
         const char* const from = cursor_;
-        while (cursor_ != end_ && !kStopsText[static_cast<unsigned char>(*cursor_)]) ++cursor_;
+        cursor_ = endOfPlainText(from, end_);
         scratch_.append(from, cursor_);
         break;
       }
@@ -494,11 +580,10 @@ bool Reader::textWithMarkup(std::string_view name, std::string_view& value) {
   return false;
 }
 
-bool Reader::textNode(Tag tag, std::string_view text, Node& node) {
-  node.tag = tag;
+void Reader::textNode(std::string_view text, Node& node) {
+  node.tag = Tag::string;
   node.size = static_cast<std::uint32_t>(text.size());
   node.text = text.empty() ? "" : document_->copyText(text.data(), text.size());
-  return true;
 }
 
 bool Reader::dataNode(std::string_view text, Node& node) {
@@ -513,36 +598,41 @@ bool Reader::dataNode(std::string_view text, Node& node) {
   return true;
 }
 
-bool Reader::scalar(std::string_view name) {
+bool Reader::scalar(Element element) {
   const Form form = tagEnd();
   if (form == Form::wrong) return false;
-  Node node;
-  if (name == "true" || name == "false") {
+  Node& node = nodes_.emplace_back();
+  if (element == Element::yes || element == Element::no) {
     node.tag = Tag::boolean;
-    node.integer = name == "true" ? 1 : 0;
-    if (form == Form::open && !endTag(name)) return false;
-  } else {
-    std::string_view value;
-    if (form == Form::open && !text(name, value)) return false;
-    bool good = false;
-    if (name == "string") {
-      good = textNode(Tag::string, value, node);
-    } else if (name == "key") {
-      good = textNode(Tag::string, value, node);
-      setKeyHash(node);
-    } else if (name == "integer") {
-      good = readInteger(value, node);
-    } else if (name == "data") {
-      good = dataNode(value, node);
-    } else if (name == "real") {
-      good = readReal(value, node);
-    } else if (name == "date") {
-      good = readDate(value, node);
-    }
-    if (!good) return false;
+    node.integer = element == Element::yes ? 1 : 0;
+    return form == Form::empty || endTag(element);
   }
-  nodes_.push_back(node);
-  return true;
+  std::string_view value;
+  if (form == Form::open && !text(element, value)) return false;
+  switch (element) {
+    case Element::key:
+      textNode(value, node);
+      setKeyHash(node);
+      return true;
+    case Element::string:
+      textNode(value, node);
+      return true;
+    case Element::integer:
+      return readInteger(value, node);
+    case Element::real:
+      return readReal(value, node);
+    case Element::date:
+      return readDate(value, node);
+    case Element::data:
+      return dataNode(value, node);
+    case Element::array:
+    case Element::dictionary:
+    case Element::no:
+    case Element::yes:
+    case Element::unknown:
+      break;
+  }
+  return false;
 }
 
 bool Reader::beginContainer(bool isDictionary) {
@@ -584,18 +674,18 @@ bool Reader::content() {
     if (!misc() || left() < 2 || *cursor_ != '<') return false;
     if (cursor_[1] == '/') {
       if (frames_.empty()) return false;
-      if (!endTag(frames_.back().isDictionary ? "dict" : "array") || !endContainer()) return false;
+      const Element open = frames_.back().isDictionary ? Element::dictionary : Element::array;
+      if (!endTag(open) || !endContainer()) return false;
       continue;
     }
-    const char* const from = ++cursor_;
-    while (cursor_ != end_ && isLetter(*cursor_)) ++cursor_;
-    const std::string_view name(from, static_cast<std::size_t>(cursor_ - from));
+    ++cursor_;
+    const Element element = elementName();
     const bool keyWanted =
         !frames_.empty() && frames_.back().isDictionary && (nodes_.size() - frames_.back().base) % 2 == 0;
-    if (keyWanted != (name == "key")) return false;
-    if (name == "dict" || name == "array") {
-      if (!beginContainer(name == "dict")) return false;
-    } else if (!scalar(name)) {
+    if (keyWanted != (element == Element::key)) return false;
+    if (element == Element::dictionary || element == Element::array) {
+      if (!beginContainer(element == Element::dictionary)) return false;
+    } else if (!scalar(element)) {
       return false;
     }
   } while (!frames_.empty());

@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/plist/XmlWriter.h"
 
+#include <algorithm>
 #include <array>
 #include <charconv>
 #include <cmath>
@@ -164,6 +165,12 @@ void Writer::flush() {
   if (out_.size() + used > kLargestXmlForm) {
     failed_ = true;
     return;
+  }
+  const std::size_t size = out_.size() + used;
+  // Grown in few and large steps: pages not written to cost nothing, and copies do. What fits one buffer, as
+  // nearly everything does, gets its own size.
+  if (out_.capacity() < size) {
+    out_.reserve(out_.empty() ? size : std::min(kLargestXmlForm, std::max(size, out_.capacity() * 4)));
   }
   out_.append(buffer_.get(), used);
 }

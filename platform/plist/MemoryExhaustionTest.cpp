@@ -1,0 +1,182 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+//
+// Every allocation of every operation fails once, alone and with all that follow it. The C library's
+// functions are replaced for this program; sanitizers have replaced them already, so there these tests are
+// skipped.
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <functional>
+
+#include "platform/plist/PropertyListCodec.h"
+
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+#define BRENVIK_MALLOC_IS_TAKEN
+#elif defined(__has_feature)
+#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
+#define BRENVIK_MALLOC_IS_TAKEN
+#endif
+#endif
+
+#ifndef BRENVIK_MALLOC_IS_TAKEN
+
+namespace {
+
+constinit thread_local bool armed = false;
+constinit thread_local bool allFollowing = false;
+constinit thread_local long untilFailure = 0;
+constinit thread_local long failures = 0;
+
+bool failsNow() {
+  if (!armed || untilFailure-- > 0) return false;
+  if (untilFailure != -1 && !allFollowing) return false;
+  ++failures;
+  return true;
+}
+
+}  // namespace
+
+extern "C" {
+void* __libc_malloc(std::size_t size);
+void* __libc_calloc(std::size_t count, std::size_t size);
+void* __libc_realloc(void* memory, std::size_t size);
+void* malloc(std::size_t size) { return failsNow() ? nullptr : __libc_malloc(size); }
+void* calloc(std::size_t count, std::size_t size) {
+  return failsNow() ? nullptr : __libc_calloc(count, size);
+}
+void* realloc(void* memory, std::size_t size) { return failsNow() ? nullptr : __libc_realloc(memory, size); }
+}
+
+namespace brenvik {
+namespace {
+
+// `operation` says whether it had a result; `check` whether the last result was right.
+void failEveryAllocation(const std::function<bool()>& operation, const std::function<bool()>& check) {
+  ASSERT_TRUE(operation());
+  ASSERT_TRUE(check());
+  for (const bool following : {false, true}) {
+    long failed = 0;
+    while (true) {
+      armed = true;
+      allFollowing = following;
+      untilFailure = failed;
+      failures = 0;
+      const bool done = operation();
+      armed = false;
+      if (failures == 0) break;
+      if (done) {
+        ASSERT_TRUE(check()) << "allocation " << failed;
+      }
+      ++failed;
+    }
+    EXPECT_GT(failed, 0);
+  }
+}
+
+PropertyList sample() {
+  std::vector<std::pair<std::string, PropertyList>> entries;
+  for (int i = 0; i < 40; ++i) {
+    const std::string name = "entry " + std::to_string(i);
+    entries.emplace_back(name, PropertyList::array({PropertyList::integer(i), PropertyList::real(i + 0.5),
+                                                    PropertyList::string(std::string(300, '<') + name),
+                                                    PropertyList::array({PropertyList::date(i)})}));
+  }
+  return PropertyList::dictionary(std::move(entries));
+}
+
+class MemoryExhaustionTest : public testing::TestWithParam<PropertyListFormat> {};
+
+TEST_P(MemoryExhaustionTest, ReadingGivesTheValueOrNone) {
+  const PropertyList value = sample();
+  const std::string document = serializePropertyList(value, GetParam()).value();
+  PropertyList read;
+  failEveryAllocation(
+      [&] {
+        read = parsePropertyList(std::as_bytes(std::span(document)));
+        return read.hasValue();
+      },
+      [&] { return read == value; });
+}
+
+TEST_P(MemoryExhaustionTest, WritingGivesTheDocumentOrNone) {
+  const PropertyList value = sample();
+  const std::string document = serializePropertyList(value, GetParam()).value();
+  std::optional<std::string> written;
+  failEveryAllocation(
+      [&] {
+        written.reset();
+        written = serializePropertyList(value, GetParam());
+        return written.has_value();
+      },
+      [&] { return written == document; });
+}
+
+INSTANTIATE_TEST_SUITE_P(BothFormats, MemoryExhaustionTest,
+                         testing::Values(PropertyListFormat::xml, PropertyListFormat::binary));
+
+TEST(MemoryExhaustionTest, ReadingWhatMustBeMeasuredExactlyGivesTheValueOrNone) {
+  // So many small things that the quick bound of the size as XML does not do.
+  const PropertyList row = PropertyList::array(std::vector(1000, PropertyList::boolean(true)));
+  const PropertyList value = PropertyList::array(std::vector(3000, row));
+  const std::string document = serializePropertyList(value, PropertyListFormat::binary).value();
+  PropertyList read;
+  failEveryAllocation(
+      [&] {
+        read = parsePropertyList(std::as_bytes(std::span(document)));
+        return read.hasValue();
+      },
+      [&] { return read == value; });
+}
+
+TEST(MemoryExhaustionTest, BuildingGivesTheValueOrNone) {
+  const PropertyList part = PropertyList::string(std::string(1000, 'x'));
+  const PropertyList whole = PropertyList::dictionary({{"a", part}, {"b", PropertyList::array({part})}});
+  PropertyList made;
+  failEveryAllocation(
+      [&] {
+        made = whole.withEntry("c", part);
+        return made.hasValue();
+      },
+      [&] { return made.size() == 3 && made.find("c") == part; });
+  failEveryAllocation(
+      [&] {
+        made = PropertyList::string("a text that takes memory");
+        return made.hasValue();
+      },
+      [&] { return made.asString() == "a text that takes memory"; });
+  std::vector<PropertyList> elements;
+  std::vector<std::pair<std::string, PropertyList>> entries;
+  failEveryAllocation(
+      [&] {
+        const bool wasArmed = std::exchange(armed, false);
+        elements = {part, whole};
+        entries = {{"part", part}, {"whole", whole}};
+        armed = wasArmed;
+        const PropertyList array = PropertyList::array(std::move(elements));
+        made = PropertyList::dictionary(std::move(entries));
+        return array && made;
+      },
+      [&] { return made.find("whole") == whole; });
+}
+
+TEST(MemoryExhaustionTest, ComparisonThatCannotBeMadeIsNotEqual) {
+  const PropertyList one = sample();
+  const PropertyList other = sample();
+  bool equal = false;
+  failEveryAllocation(
+      [&] {
+        equal = one == other;
+        return equal;
+      },
+      [&] { return equal; });
+}
+
+}  // namespace
+}  // namespace brenvik
+
+#else
+
+TEST(MemoryExhaustionTest, NeedsTheAllocatorForItself) { GTEST_SKIP() << "a sanitizer has it"; }
+
+#endif
