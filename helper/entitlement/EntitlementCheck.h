@@ -1,0 +1,49 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstddef>
+#include <memory>
+#include <string_view>
+
+#include "platform/ipc/AuditToken.h"
+#include "platform/runloop/WorkQueue.h"
+#include "platform/security/TaskSecurity.h"
+
+namespace brenvik {
+
+// Whether a caller holds a boolean entitlement. The security service is asked once a process: what it grants
+// is remembered until that process exits. What it does not grant is not remembered. Any thread.
+class EntitlementCheck {
+ public:
+  // Both must outlive the last call of HasEntitlement. Processes are watched through `queues`; after this
+  // object is gone their exits are of no interest.
+  EntitlementCheck(TaskSecurity& security, WorkQueues& queues);
+  EntitlementCheck(const EntitlementCheck&) = delete;
+  EntitlementCheck& operator=(const EntitlementCheck&) = delete;
+  ~EntitlementCheck();  // as tearDown
+
+  // True when the caller holds it with the value true. False, too, when there is no such caller, when the
+  // service could not answer, or when the value is no boolean.
+  bool HasEntitlement(std::string_view name, const AuditToken& caller) noexcept;
+
+  // Stops watching and forgets every grant, for good: from then on each question goes to the service.
+  void tearDown() noexcept;
+
+  // How many grants are remembered, and how many processes are watched.
+  std::size_t grants() const noexcept;
+  std::size_t watchers() const noexcept;
+
+  // The process's one check, made on first use with the services of that first call and torn down at exit.
+  static EntitlementCheck& processWide(TaskSecurity& security, WorkQueues& queues);
+
+ private:
+  struct State;
+  void remember(std::string_view name, const AuditToken& caller);
+
+  TaskSecurity& security_;
+  WorkQueues& queues_;
+  const std::shared_ptr<State> state_;  // an exit handler that is late finds it, or finds it gone
+};
+
+}  // namespace brenvik

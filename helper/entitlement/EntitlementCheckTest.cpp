@@ -1,0 +1,457 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "helper/entitlement/EntitlementCheck.h"
+
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <array>
+#include <atomic>
+#include <barrier>
+#include <csignal>
+#include <future>
+#include <map>
+#include <mutex>
+#include <thread>
+#include <vector>
+
+#include "platform/base/ProcessStartTime.h"
+#include "platform/runloop/fakes/ManualRunLoop.h"
+#include "platform/runloop/linux/SystemQueues.h"
+#include "platform/security/fakes/FakeTaskSecurity.h"
+
+namespace brenvik {
+namespace {
+
+constexpr const char* kName = "com.norvale.Teravox.BrenvikHelper.allow";
+constexpr const char* kOther = "com.norvale.other";
+
+AuditToken tokenOf(pid_t pid, std::uint32_t version = 100) {
+  AuditToken token;
+  token.words = {~0U, 501, 20, 501, 20, static_cast<std::uint32_t>(pid), 1, version};
+  return token;
+}
+
+class EntitlementCheckTest : public testing::Test {
+ protected:
+  void exits(pid_t pid) {
+    queues.processExits(pid);
+    queues.global().runReady();
+  }
+  ManualClock clock;
+  ManualWorkQueues queues{clock};
+  FakeTaskSecurity security;
+  EntitlementCheck check{security, queues};
+  const AuditToken caller = tokenOf(7);
+};
+
+TEST_F(EntitlementCheckTest, ACallerThatHoldsTheEntitlementAsTrueIsGranted) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+}
+
+TEST_F(EntitlementCheckTest, ACallerThatHoldsItAsSomethingThatIsNoBooleanIsRefused) {
+  for (const auto& value : {PropertyList::string("true"), PropertyList::integer(1), PropertyList::real(1),
+                            PropertyList::array({PropertyList::boolean(true)})}) {
+    security.grant(caller, kName, value);
+    EXPECT_FALSE(check.HasEntitlement(kName, caller));
+  }
+}
+
+TEST_F(EntitlementCheckTest, ACallerThatHoldsItAsFalseIsRefused) {
+  security.grant(caller, kName, PropertyList::boolean(false));
+  EXPECT_FALSE(check.HasEntitlement(kName, caller));
+}
+
+TEST_F(EntitlementCheckTest, ACallerWithoutItIsRefused) {
+  security.addProcess(caller);
+  EXPECT_FALSE(check.HasEntitlement(kName, caller));
+  security.grant(caller, kOther, PropertyList::boolean(true));
+  EXPECT_FALSE(check.HasEntitlement(kName, caller));
+}
+
+TEST_F(EntitlementCheckTest, ACallerThatIsGoneIsRefusedWithoutAQuestion) {
+  EXPECT_FALSE(check.HasEntitlement(kName, caller));
+  EXPECT_EQ(security.tasksWanted(), 1);
+  EXPECT_EQ(security.questions(), 0);
+}
+
+TEST_F(EntitlementCheckTest, AnErrorRefusesWhateverValueCameWithIt) {
+  security.grant(caller, kName, PropertyList::boolean(true), true);
+  EXPECT_FALSE(check.HasEntitlement(kName, caller));
+  security.grant(caller, kName, PropertyList(), true);
+  EXPECT_FALSE(check.HasEntitlement(kName, caller));
+}
+
+TEST_F(EntitlementCheckTest, ASecondCheckInByTheSameProcessIsAnsweredWithoutAskingTheService) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_EQ(security.tasksWanted(), 1);
+  EXPECT_EQ(security.questions(), 1);
+  EXPECT_EQ(check.grants(), 1U);
+  EXPECT_EQ(queues.watchersOf(7), 1U);
+}
+
+TEST_F(EntitlementCheckTest, AGrantStaysThoughTheServiceWouldRefuseByNow) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  security.grant(caller, kName, PropertyList::boolean(false));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+}
+
+TEST_F(EntitlementCheckTest, AnotherNameOfTheSameProcessIsAskedForAndNeedsNoSecondWatcher) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  security.grant(caller, kOther, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_TRUE(check.HasEntitlement(kOther, caller));
+  EXPECT_EQ(security.questions(), 2);
+  EXPECT_EQ(check.grants(), 2U);
+  EXPECT_EQ(check.watchers(), 1U);
+  EXPECT_EQ(queues.watchersOf(7), 1U);
+}
+
+TEST_F(EntitlementCheckTest, AnotherProcessIsAskedForAndWatchedByItself) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_FALSE(check.HasEntitlement(kName, tokenOf(8)));
+  security.grant(tokenOf(9), kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, tokenOf(9)));
+  EXPECT_EQ(queues.watchersOf(7), 1U);
+  EXPECT_EQ(queues.watchersOf(8), 0U);
+  EXPECT_EQ(queues.watchersOf(9), 1U);
+}
+
+TEST_F(EntitlementCheckTest, ARefusedCallerLeavesNoCacheEntryAndNoWatcher) {
+  security.grant(caller, kName, PropertyList::string("true"));
+  EXPECT_FALSE(check.HasEntitlement(kName, caller));
+  EXPECT_FALSE(check.HasEntitlement(kName, tokenOf(8)));
+  EXPECT_EQ(check.grants(), 0U);
+  EXPECT_EQ(check.watchers(), 0U);
+  EXPECT_EQ(queues.watchersOf(7), 0U);
+  EXPECT_EQ(queues.watchersOf(8), 0U);
+}
+
+TEST_F(EntitlementCheckTest, ARefusalIsNotRemembered) {
+  security.addProcess(caller);
+  EXPECT_FALSE(check.HasEntitlement(kName, caller));
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+}
+
+TEST_F(EntitlementCheckTest, AfterTheProcessExitsItsEntriesAndItsWatcherAreGone) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  security.grant(caller, kOther, PropertyList::boolean(true));
+  security.grant(tokenOf(9), kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_TRUE(check.HasEntitlement(kOther, caller));
+  EXPECT_TRUE(check.HasEntitlement(kName, tokenOf(9)));
+  exits(7);
+  EXPECT_EQ(check.grants(), 1U) << "the other process keeps its own";
+  EXPECT_EQ(check.watchers(), 1U);
+  EXPECT_EQ(queues.watchersOf(7), 0U);
+  EXPECT_EQ(queues.watchersOf(9), 1U);
+}
+
+TEST_F(EntitlementCheckTest, ANewProcessThatReusesTheIdIsAskedAfresh) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  exits(7);
+  const AuditToken successor = tokenOf(7, 200);
+  security.addProcess(successor);
+  EXPECT_FALSE(check.HasEntitlement(kName, successor));
+  EXPECT_EQ(security.questions(), 2);
+}
+
+TEST_F(EntitlementCheckTest, AProcessThatReusesTheIdIsAskedAfreshEvenBeforeTheExitWasHandled) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  const AuditToken successor = tokenOf(7, 200);
+  security.addProcess(successor);
+  EXPECT_FALSE(check.HasEntitlement(kName, successor));
+  EXPECT_EQ(security.questions(), 2);
+}
+
+TEST_F(EntitlementCheckTest, ASuccessorGrantedBeforeTheExitWasHandledIsForgottenWithItAndAskedAgain) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  const AuditToken successor = tokenOf(7, 200);
+  security.grant(successor, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, successor));
+  EXPECT_TRUE(check.HasEntitlement(kName, successor));
+  EXPECT_EQ(security.questions(), 2) << "its own grant is remembered meanwhile";
+  EXPECT_EQ(check.watchers(), 1U);
+  exits(7);
+  EXPECT_EQ(check.grants(), 0U);
+  EXPECT_EQ(check.watchers(), 0U);
+  EXPECT_TRUE(check.HasEntitlement(kName, successor));
+  EXPECT_EQ(security.questions(), 3);
+  EXPECT_EQ(queues.watchersOf(7), 1U);
+}
+
+TEST_F(EntitlementCheckTest, WithoutAWatcherTheGrantIsRememberedAllTheSame) {
+  queues.refuseProcessExitSources = true;
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_EQ(security.questions(), 1);
+  EXPECT_EQ(check.grants(), 1U);
+  EXPECT_EQ(check.watchers(), 0U);
+  queues.refuseProcessExitSources = false;
+  security.grant(caller, kOther, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kOther, caller));
+  EXPECT_EQ(check.watchers(), 0U) << "the process has an entry already";
+}
+
+TEST_F(EntitlementCheckTest, ATokenThatNamesNoProcessIsCheckedUnderMinusOne) {
+  const AuditToken nobody = tokenOf(0);
+  ASSERT_EQ(nobody.pid(), -1);
+  EXPECT_FALSE(check.HasEntitlement(kName, nobody));
+  security.grant(nobody, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, nobody));
+  EXPECT_EQ(queues.watchersOf(-1), 1U);
+}
+
+TEST_F(EntitlementCheckTest, TheLockIsNotHeldWhileTheServiceIsAskedAndTheDuplicateOfTwoMissesIsHarmless) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  std::barrier bothAreAsking(2);  // with the lock held, the second could not ask before the first is done
+  security.whileAsked = [&] { bothAreAsking.arrive_and_wait(); };
+  std::array<bool, 2> granted{};
+  {
+    std::jthread first([&] { granted[0] = check.HasEntitlement(kName, caller); });
+    std::jthread second([&] { granted[1] = check.HasEntitlement(kName, caller); });
+  }
+  EXPECT_TRUE(granted[0]);
+  EXPECT_TRUE(granted[1]);
+  EXPECT_EQ(check.grants(), 2U);
+  EXPECT_EQ(check.watchers(), 1U);
+  EXPECT_EQ(queues.watchersOf(7), 1U);
+  exits(7);
+  EXPECT_EQ(check.grants(), 0U);
+  EXPECT_EQ(check.watchers(), 0U);
+}
+
+TEST_F(EntitlementCheckTest, TheTeardownEndsEveryWatcherAndForgetsEveryGrant) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  security.grant(tokenOf(9), kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_TRUE(check.HasEntitlement(kName, tokenOf(9)));
+  check.tearDown();
+  EXPECT_EQ(check.grants(), 0U);
+  EXPECT_EQ(check.watchers(), 0U);
+  EXPECT_EQ(queues.watchersOf(7), 0U);
+  EXPECT_EQ(queues.watchersOf(9), 0U);
+  check.tearDown();
+
+  EXPECT_TRUE(check.HasEntitlement(kName, caller)) << "still answered";
+  EXPECT_EQ(security.questions(), 3);
+  EXPECT_EQ(check.grants(), 0U) << "but no longer remembered";
+  EXPECT_EQ(queues.watchersOf(7), 0U);
+}
+
+TEST_F(EntitlementCheckTest, AnExitHandledAfterTheTeardownFindsNothingToDo) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  queues.processExits(7);
+  check.tearDown();
+  EXPECT_GE(queues.global().runReady(), 1);
+  EXPECT_EQ(check.watchers(), 0U);
+}
+
+TEST_F(EntitlementCheckTest, AnExitHandledAfterTheCheckIsGoneFindsNothingToDo) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  {
+    EntitlementCheck shortLived(security, queues);
+    EXPECT_TRUE(shortLived.HasEntitlement(kName, caller));
+    queues.processExits(7);
+  }
+  EXPECT_EQ(queues.watchersOf(7), 0U);
+  EXPECT_GE(queues.global().runReady(), 1);
+}
+
+TEST_F(EntitlementCheckTest, TwoChecksKnowNothingOfEachOther) {
+  EntitlementCheck another(security, queues);
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_EQ(another.grants(), 0U);
+  EXPECT_TRUE(another.HasEntitlement(kName, caller));
+  EXPECT_EQ(security.questions(), 2);
+}
+
+TEST(ProcessWideEntitlementCheckTest, IsMadeOnFirstUseAndIsTheSameForEveryone) {
+  static ManualClock clock;  // these outlive the check, which is torn down at exit
+  static ManualWorkQueues queues(clock);
+  static FakeTaskSecurity security;
+  FakeTaskSecurity otherSecurity;
+  EntitlementCheck& check = EntitlementCheck::processWide(security, queues);
+  EXPECT_EQ(&EntitlementCheck::processWide(otherSecurity, queues), &check);
+  security.grant(tokenOf(7), kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, tokenOf(7)));
+  EXPECT_EQ(otherSecurity.tasksWanted(), 0);
+}
+
+// Process-exit sources whose handlers run on whatever thread reports the exit; nothing else is used.
+class ThreadedExits final : public WorkQueues {
+ public:
+  WorkQueue& main() noexcept override { std::abort(); }
+  WorkQueue& global() noexcept override { std::abort(); }
+  std::shared_ptr<WorkQueue> makeSerial(std::string, QualityOfService) override { std::abort(); }
+  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t, WorkQueue::Task onExit,
+                                                           WorkQueue::Task) override {
+    auto source = std::make_unique<Source>(*this);
+    const std::lock_guard lock(mutex_);
+    watched_.emplace(source.get(), std::make_pair(pid, std::move(onExit)));
+    return source;
+  }
+  void processExits(pid_t pid) {
+    std::vector<WorkQueue::Task> handlers;
+    {
+      const std::lock_guard lock(mutex_);
+      for (const auto& [source, watch] : watched_) {
+        if (watch.first == pid) handlers.push_back(watch.second);
+      }
+    }
+    for (const auto& handler : handlers) handler();
+  }
+  std::size_t watched() {
+    const std::lock_guard lock(mutex_);
+    return watched_.size();
+  }
+
+ private:
+  class Source final : public ProcessExitSource {
+   public:
+    explicit Source(ThreadedExits& owner) : owner_(owner) {}
+    ~Source() override { cancel(); }
+    void activate() override {}
+    void cancel() noexcept override {
+      const std::lock_guard lock(owner_.mutex_);
+      owner_.watched_.erase(this);
+    }
+
+   private:
+    ThreadedExits& owner_;
+  };
+  std::mutex mutex_;
+  std::map<Source*, std::pair<pid_t, WorkQueue::Task>> watched_;
+};
+
+TEST(EntitlementCheckConcurrencyTest, ChecksExitsAndTheTeardownMayMeetInAnyOrder) {
+  constexpr int kThreads = 4;
+  constexpr int kRounds = 2000;
+  constexpr pid_t kProcesses = 8;
+  ThreadedExits queues;
+  FakeTaskSecurity security;
+  EntitlementCheck check(security, queues);
+  for (pid_t pid = 1; pid <= kProcesses; ++pid) {
+    security.grant(tokenOf(pid, 1), kName, PropertyList::boolean(true));
+    security.grant(tokenOf(pid, 2), kName, PropertyList::boolean(false));
+  }
+  std::atomic<int> wrong{0};
+  std::atomic<bool> done{false};
+  std::jthread exits([&] {
+    for (pid_t pid = 1; !done; pid = pid % kProcesses + 1) queues.processExits(pid);
+  });
+  {
+    std::vector<std::jthread> callers;
+    for (int thread = 0; thread < kThreads; ++thread) {
+      callers.emplace_back([&check, &wrong, thread] {
+        for (int round = 0; round < kRounds; ++round) {
+          const pid_t pid = (round * (thread + 1)) % kProcesses + 1;
+          if (!check.HasEntitlement(kName, tokenOf(pid, 1))) ++wrong;
+          if (check.HasEntitlement(kName, tokenOf(pid, 2))) ++wrong;
+        }
+      });
+    }
+  }
+  done = true;
+  exits.join();
+  EXPECT_EQ(wrong, 0);
+  for (pid_t pid = 1; pid <= kProcesses; ++pid) queues.processExits(pid);
+  EXPECT_EQ(check.grants(), 0U);
+  EXPECT_EQ(check.watchers(), 0U);
+  EXPECT_EQ(queues.watched(), 0U);
+
+  std::jthread last([&] { queues.processExits(1); });
+  EXPECT_TRUE(check.HasEntitlement(kName, tokenOf(1, 1)));
+  check.tearDown();
+  last.join();
+  EXPECT_EQ(queues.watched(), 0U);
+}
+
+// The system's queues, which tell when an exit has been handled.
+class ObservedQueues final : public WorkQueues {
+ public:
+  explicit ObservedQueues(WorkQueues& real) : real_(real) {}
+  WorkQueue& main() noexcept override { return real_.main(); }
+  WorkQueue& global() noexcept override { return real_.global(); }
+  std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
+    return real_.makeSerial(std::move(label), qualityOfService);
+  }
+  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t startTime,
+                                                           WorkQueue::Task onExit,
+                                                           WorkQueue::Task onCancel) override {
+    return real_.makeProcessExitSource(
+        pid, startTime,
+        [this, onExit = std::move(onExit)] {
+          const auto tell = handled;  // the handler destroys the source, and this task with it
+          onExit();
+          tell->set_value();
+        },
+        std::move(onCancel));
+  }
+  const std::shared_ptr<std::promise<void>> handled = std::make_shared<std::promise<void>>();
+
+ private:
+  WorkQueues& real_;
+};
+
+class RealProcessTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    child = ::fork();
+    if (child == 0) {
+      ::pause();
+      ::_exit(0);
+    }
+    ASSERT_GT(child, 0);
+    caller = tokenOf(child, processStartTime(child).value());
+    security.grant(caller, kName, PropertyList::boolean(true));
+  }
+  void TearDown() override { endChild(); }
+  void endChild() {
+    if (child <= 0) return;
+    ::kill(child, SIGKILL);
+    ::waitpid(child, nullptr, 0);
+    child = -1;
+  }
+  std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
+  SystemQueues system{*loop};
+  ObservedQueues queues{system};
+  FakeTaskSecurity security;
+  EntitlementCheck check{security, queues};
+  pid_t child = -1;
+  AuditToken caller;
+};
+
+TEST_F(RealProcessTest, AGrantIsForgottenWhenItsProcessExits) {
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_EQ(check.grants(), 1U);
+  EXPECT_EQ(check.watchers(), 1U);
+  endChild();
+  ASSERT_EQ(queues.handled->get_future().wait_for(std::chrono::seconds(30)), std::future_status::ready);
+  EXPECT_EQ(check.grants(), 0U);
+  EXPECT_EQ(check.watchers(), 0U);
+}
+
+TEST_F(RealProcessTest, AProcessThatExitsWhileItIsBeingGrantedIsForgottenAtOnce) {
+  security.whileAsked = [this] { endChild(); };
+  EXPECT_TRUE(check.HasEntitlement(kName, caller)) << "it was there when the service answered";
+  ASSERT_EQ(queues.handled->get_future().wait_for(std::chrono::seconds(30)), std::future_status::ready);
+  EXPECT_EQ(check.grants(), 0U);
+  EXPECT_EQ(check.watchers(), 0U);
+}
+
+}  // namespace
+}  // namespace brenvik
