@@ -117,11 +117,6 @@ std::optional<DomainImage> DomainImage::of(const PropertyList& dictionary) {
     image.xmlSize_ = saturatingSum(image.xmlSize_, xmlSizeOf(keyObject, value.extent()));
     if (image.objects_.size() > kLargestImage) return std::nullopt;
   }
-  image.byKey_.resize(image.entries_.size());
-  for (std::size_t i = 0; i < image.byKey_.size(); ++i) image.byKey_[i] = static_cast<std::uint32_t>(i);
-  std::sort(image.byKey_.begin(), image.byKey_.end(), [&image](std::uint32_t one, std::uint32_t other) {
-    return image.keyObject(one) < image.keyObject(other);
-  });
   return image;
 }
 
@@ -129,10 +124,9 @@ PropertyList DomainImage::find(std::string_view key) const {
   if (!isValidUtf8(key)) return {};
   std::string wanted;
   bplist::appendString(wanted, key);
-  const std::size_t rank = rankOf(wanted);
-  if (!hasKey(rank, wanted)) return {};
+  const std::size_t entry = entryOf(wanted);
+  if (entry == entries_.size()) return {};
   // The entry's objects make a document of their own.
-  const std::size_t entry = byKey_[rank];
   const std::size_t firstObject = entries_[entry].first + 1;
   const std::size_t firstByte = offsets_[firstObject];
   const std::span<const std::uint32_t> offsets(offsets_.data() + firstObject,
@@ -157,6 +151,7 @@ DomainImage::Change DomainImage::set(std::string_view key, const PropertyList& v
   if (!isValidUtf8(key)) return Change::refused;
   std::string wanted;
   bplist::appendString(wanted, key);
+  makeIndex();
   const std::size_t rank = rankOf(wanted);
   const bool exists = hasKey(rank, wanted);
   const std::size_t entry = exists ? byKey_[rank] : entries_.size();
@@ -248,6 +243,25 @@ std::size_t DomainImage::rankOf(std::string_view keyObject) const noexcept {
       std::lower_bound(byKey_.begin(), byKey_.end(), keyObject,
                        [this](std::uint32_t entry, auto key) { return this->keyObject(entry) < key; });
   return static_cast<std::size_t>(at - byKey_.begin());
+}
+
+// Without the index, whoever reads a value or two looks through the keys; making it would take longer.
+std::size_t DomainImage::entryOf(std::string_view keyObject) const noexcept {
+  if (byKey_.size() == entries_.size()) {
+    const std::size_t rank = rankOf(keyObject);
+    return hasKey(rank, keyObject) ? byKey_[rank] : entries_.size();
+  }
+  std::size_t entry = 0;
+  while (entry < entries_.size() && this->keyObject(entry) != keyObject) ++entry;
+  return entry;
+}
+
+void DomainImage::makeIndex() {
+  if (byKey_.size() == entries_.size()) return;
+  byKey_.resize(entries_.size());
+  for (std::size_t i = 0; i < byKey_.size(); ++i) byKey_[i] = static_cast<std::uint32_t>(i);
+  std::sort(byKey_.begin(), byKey_.end(),
+            [this](std::uint32_t one, std::uint32_t other) { return keyObject(one) < keyObject(other); });
 }
 
 bool DomainImage::hasKey(std::size_t rank, std::string_view keyObject) const noexcept {

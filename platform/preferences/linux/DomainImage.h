@@ -65,6 +65,8 @@ class DomainImage {
   std::uint32_t endOfNumbers(std::size_t entry) const noexcept;
   std::size_t endOfBytes(std::size_t entry) const noexcept;
   std::string_view keyObject(std::size_t entry) const noexcept;
+  std::size_t entryOf(std::string_view keyObject) const noexcept;
+  void makeIndex();
   std::size_t rankOf(std::string_view keyObject) const noexcept;
   bool hasKey(std::size_t rank, std::string_view keyObject) const noexcept;
   void append(std::string_view keyObject, const bplist::Extractor& value);
@@ -78,7 +80,7 @@ class DomainImage {
   std::string objects_{bplist::kMagic};  // the file up to the dictionary
   std::vector<std::uint32_t> offsets_;   // by object number, in the order of the bytes
   std::vector<Entry> entries_;           // in the order of the bytes
-  std::vector<std::uint32_t> byKey_;     // places in entries_, ordered by key object
+  std::vector<std::uint32_t> byKey_;     // places in entries_, ordered by key object; empty until needed
   std::size_t widthOfReference_ = 1;
   std::uint64_t xmlSize_ = 0;  // of everything ever put in: at least what the XML form takes
   std::string tail_;

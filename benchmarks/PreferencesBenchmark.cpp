@@ -1,0 +1,141 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include <benchmark/benchmark.h>
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/preferences/linux/FilePreferences.h"
+
+// One durable set (setValue and synchronize) beside the least that durability costs: writing, syncing and
+// renaming the same bytes, and syncing the folder. Disks have moods, so each set is followed by the bare
+// write at once, and the medians of both are compared. Takes place in a folder made below the current one, or
+// below the folder named in BRENVIK_BENCHMARK_FOLDER; on a file system in memory the figures would say
+// nothing.
+namespace brenvik {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+constexpr double kMost = 1.25;  // times the bare write
+constexpr const char kDomain[] = "com.example.benchmark";
+
+struct Times {
+  std::vector<double> ours;  // seconds
+  std::vector<double> bare;
+  std::size_t bytes = 0;
+};
+std::map<std::int64_t, Times> timesByKeys;
+
+double median(std::vector<double> all) {
+  if (all.empty()) return 0;
+  std::nth_element(all.begin(), all.begin() + static_cast<std::ptrdiff_t>(all.size() / 2), all.end());
+  return all[all.size() / 2];
+}
+
+void require(bool holds, const char* what) {
+  if (holds) return;
+  std::perror(what);
+  std::exit(2);
+}
+
+class Folder {
+ public:
+  Folder() {
+    const char* const below = std::getenv("BRENVIK_BENCHMARK_FOLDER");
+    std::string name = std::string(below != nullptr ? below : ".") + "/preferences-benchmark.XXXXXX";
+    require(::mkdtemp(name.data()) != nullptr, "mkdtemp");
+    path = std::filesystem::absolute(name);
+  }
+  Folder(const Folder&) = delete;
+  Folder& operator=(const Folder&) = delete;
+  ~Folder() { std::filesystem::remove_all(path); }
+  std::filesystem::path path;
+};
+
+void bareWrite(int folder, const std::string& bytes) {
+  UniqueFd file(::openat(folder, "bare.tmp", O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
+  require(file.isValid(), "open");
+  require(::write(file.get(), bytes.data(), bytes.size()) == static_cast<ssize_t>(bytes.size()), "write");
+  require(::fsync(file.get()) == 0, "fsync");
+  file.reset();
+  require(::renameat(folder, "bare.tmp", folder, "bare") == 0, "rename");
+  require(::fsync(folder) == 0, "fsync");
+}
+
+void durableSet(benchmark::State& state) {
+  const auto keys = static_cast<std::uint64_t>(state.range(0));
+  const Folder home;
+  FilePreferences store([&home] { return FilePreferences::Places{home.path, home.path / "any", ""}; });
+  const auto keyOf = [](std::uint64_t i) { return "com.example.setting." + std::to_string(i); };
+  std::uint64_t number = 1'000'000;
+  const auto nextValue = [&number] { return PropertyList::string("value " + std::to_string(++number)); };
+  const auto sync = [&store] {
+    require(store.synchronize(kDomain, UserScope::currentUser, HostScope::anyHost), "synchronize");
+  };
+  for (std::uint64_t i = 0; i < keys; ++i) {
+    store.setValue(keyOf(i), nextValue(), kDomain, UserScope::currentUser, HostScope::anyHost);
+  }
+  sync();
+  const auto path = home.path / "Library/Preferences" / (std::string(kDomain) + ".plist");
+  std::ifstream in(path, std::ios::binary);
+  const std::string bytes{std::istreambuf_iterator<char>(in), {}};
+  const UniqueFd folder(::open(path.parent_path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  require(folder.isValid() && !bytes.empty(), "the domain's file");
+
+  Times& times = timesByKeys[state.range(0)];
+  times.bytes = bytes.size();
+  for (auto _ : state) {
+    const std::string key = keyOf(number * 7919 % keys);
+    const PropertyList value = nextValue();
+    const auto start = Clock::now();
+    store.setValue(key, value, kDomain, UserScope::currentUser, HostScope::anyHost);
+    sync();
+    const auto middle = Clock::now();
+    bareWrite(folder.get(), bytes);
+    const auto end = Clock::now();
+    times.ours.push_back(std::chrono::duration<double>(middle - start).count());
+    times.bare.push_back(std::chrono::duration<double>(end - middle).count());
+    state.SetIterationTime(times.ours.back());
+  }
+}
+
+BENCHMARK(durableSet)
+    ->Arg(10)
+    ->Arg(1'000)
+    ->Arg(10'000)
+    ->UseManualTime()
+    ->Iterations(300)
+    ->Unit(benchmark::kMicrosecond);
+
+}  // namespace
+}  // namespace brenvik
+
+int main(int argc, char** argv) {
+  benchmark::Initialize(&argc, argv);
+  if (benchmark::ReportUnrecognizedArguments(argc, argv)) return 2;
+  benchmark::RunSpecifiedBenchmarks();
+  bool isGood = !brenvik::timesByKeys.empty();
+  std::printf("\n%10s %10s %12s %12s %8s %8s\n", "keys", "bytes", "set, us", "bare, us", "ratio", "at most");
+  for (const auto& [keys, times] : brenvik::timesByKeys) {
+    const double ours = brenvik::median(times.ours);
+    const double bare = brenvik::median(times.bare);
+    const bool isWithin = bare > 0 && ours / bare <= brenvik::kMost;
+    std::printf("%10lld %10zu %12.0f %12.0f %8.3f %8.2f  %s\n", static_cast<long long>(keys), times.bytes,
+                ours * 1e6, bare * 1e6, bare > 0 ? ours / bare : 0.0, brenvik::kMost,
+                isWithin ? "ok" : "ABOVE");
+    isGood = isGood && isWithin;
+  }
+  return isGood ? 0 : 1;
+}
