@@ -28,12 +28,14 @@ class SubscriptionLabeler {
  public:
   virtual ~SubscriptionLabeler() = default;
 
-  // Short forms of the labels (identifiers above, or a user's own texts): one to three grapheme clusters each,
-  // no two of one result alike. No value when there are more labels than such forms.
-  virtual PropertyList localizedBadgeLabels(const PropertyList& labels, const PropertyList& languages) noexcept = 0;
+  // Short forms of the labels (identifiers above, or a user's own texts): one to three grapheme clusters
+  // each, no two of one result alike. No value when there are more labels than such forms.
+  virtual PropertyList localizedBadgeLabels(const PropertyList& labels,
+                                            const PropertyList& languages) noexcept = 0;
 
   // The labels' names. A text that is no identifier is its own name. `languages` may be no value.
-  virtual PropertyList localizedLabels(const PropertyList& labels, const PropertyList& languages) noexcept = 0;
+  virtual PropertyList localizedLabels(const PropertyList& labels,
+                                       const PropertyList& languages) noexcept = 0;
 };
 
 }  // namespace brenvik

@@ -22,7 +22,8 @@ class RecordingLabeler final : public SubscriptionLabeler {
     PropertyList languages;
   };
 
-  PropertyList localizedBadgeLabels(const PropertyList& labels, const PropertyList& languages) noexcept override {
+  PropertyList localizedBadgeLabels(const PropertyList& labels,
+                                    const PropertyList& languages) noexcept override {
     return answerTo({Call::Operation::badges, labels, languages});
   }
   PropertyList localizedLabels(const PropertyList& labels, const PropertyList& languages) noexcept override {

@@ -20,7 +20,8 @@ class NormalizedRange {
       if (c >= 'A' && c <= 'Z') c = static_cast<char>(c - 'A' + 'a');
       if (c == '_') c = '-';
       if (c != '-' && !(c >= 'a' && c <= 'z') && !(c >= '0' && c <= '9')) return;
-      if (i > kLongestTag) continue;  // still looked at, so that a malformed range is refused whatever its length
+      if (i > kLongestTag)
+        continue;  // still looked at, so that a malformed range is refused whatever its length
       if (c == '-') end = i;
       if (i < kLongestTag) bytes_[i] = c;
     }
@@ -41,9 +42,10 @@ const catalogue::Catalogue* LabelCatalogue::find(std::string_view range) noexcep
   // A singleton (the "x" of a private range, the "u" of an extension) goes together with what follows it; no
   // served tag has one, so leaving it standing for one more round finds nothing either.
   for (std::string_view wanted = normalized.text(); !wanted.empty();) {
-    const auto found = std::lower_bound(
-        tags.begin(), tags.end(), wanted,
-        [](const catalogue::ServedTag& served, std::string_view tag) { return std::string_view(served.tag) < tag; });
+    const auto found = std::lower_bound(tags.begin(), tags.end(), wanted,
+                                        [](const catalogue::ServedTag& served, std::string_view tag) {
+                                          return std::string_view(served.tag) < tag;
+                                        });
     if (found != tags.end() && wanted == found->tag) return &catalogue::kCatalogues[found->catalogue];
     const std::size_t cut = wanted.rfind('-');
     wanted = wanted.substr(0, cut == std::string_view::npos ? 0 : cut);
