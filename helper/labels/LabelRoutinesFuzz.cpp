@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 //
-// Both label requests with foreign property lists. The first byte of the input chooses the request, the next two
-// (little-endian) say how many of those that follow are the labels; the rest are the languages.
+// Both label requests with foreign property lists. The first byte of the input chooses the request, the next
+// two (little-endian) say how many of those that follow are the labels; the rest are the languages.
 #include <cstdint>
 #include <cstdlib>
 #include <set>
