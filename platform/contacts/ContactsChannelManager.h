@@ -1,0 +1,33 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace brenvik {
+
+// The contacts service's view of channels: which contact is bound to which line. One object serves one
+// request. Main loop only.
+class ContactsChannelManager {
+ public:
+  virtual ~ContactsChannelManager() = default;
+
+  // Moves every reference from one channel identifier to another, all of them or none. True when none is left
+  // behind, also when there was none. On failure *error is a description in English, else it is left alone.
+  // A text that is not valid UTF-8 is a failure. May take seconds while another program writes.
+  virtual bool remapChannelIdentifier(std::string_view from, std::string_view to,
+                                      std::optional<std::string>* error) noexcept = 0;
+};
+
+// Where managers come from.
+class ContactsService {
+ public:
+  virtual ~ContactsService() = default;
+  // A new manager, or null when the contacts cannot be reached.
+  virtual std::unique_ptr<ContactsChannelManager> makeChannelManager() noexcept = 0;
+};
+
+}  // namespace brenvik

@@ -1,0 +1,151 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/contacts/linux/SqliteContacts.h"
+
+#include <sys/stat.h>
+
+#include <climits>
+#include <cstdlib>
+#include <new>
+#include <utility>
+
+#include "platform/base/Utf8.h"
+#include "platform/sqlite/Sqlite.h"
+
+namespace brenvik {
+namespace {
+
+constexpr char kBelowHome[] = "/Library/AddressBook/contacts.db";
+
+constexpr int kStepsBetweenLooks = 20000;  // at the clock, in instructions of SQLite: a millisecond or so
+
+using Clock = std::chrono::steady_clock;
+
+int isPast(void* deadline) { return Clock::now() > *static_cast<const Clock::time_point*>(deadline) ? 1 : 0; }
+
+class SqliteChannelManager final : public ContactsChannelManager {
+ public:
+  SqliteChannelManager(SqliteDatabase database, std::chrono::milliseconds patience,
+                       std::chrono::milliseconds longestRemap) noexcept
+      : database_(std::move(database)), patience_(patience), longestRemap_(longestRemap) {}
+
+  bool remapChannelIdentifier(std::string_view from, std::string_view to,
+                              std::optional<std::string>* error) noexcept override {
+    try {
+      if (!isValidUtf8(from) || !isValidUtf8(to)) {
+        *error = "a channel identifier is not valid UTF-8";
+        return false;
+      }
+      const SqliteFunctions& sql = *sqlite();
+      Clock::time_point deadline = Clock::now() + patience_ + longestRemap_;
+      (void)sql.busy_timeout(database_.get(), static_cast<int>(patience_.count()));
+      sql.progress_handler(database_.get(), kStepsBetweenLooks, &isPast, &deadline);
+      const bool done = remap(from, to);
+      // The description goes with the first failure, so it is taken before the transaction is given up.
+      if (!done) *error = sql.errmsg(database_.get());
+      sql.progress_handler(database_.get(), 0, nullptr, nullptr);
+      if (sql.get_autocommit(database_.get()) == 0) (void)run("ROLLBACK");
+      return done;
+    } catch (const std::bad_alloc&) {
+      // Closing the connection gives up what is unfinished. The error stays absent: it needs memory, too.
+      return false;
+    }
+  }
+
+ private:
+  bool run(const char* statement) noexcept {
+    return sqlite()->exec(database_.get(), statement, nullptr, nullptr, nullptr) == SQLITE_OK;
+  }
+
+  bool remap(std::string_view from, std::string_view to) noexcept {
+    // Immediate: whoever else writes is waited for here, where waiting cannot end in a deadlock.
+    return run("BEGIN IMMEDIATE") && moveReferences(from, to) && run("COMMIT");
+  }
+
+  bool moveReferences(std::string_view from, std::string_view to) noexcept {
+    constexpr char kMove[] =
+        "UPDATE contact_channels SET channel_identifier = ?2 WHERE channel_identifier = ?1";
+    const SqliteFunctions& sql = *sqlite();
+    sqlite3_stmt* prepared = nullptr;
+    if (sql.prepare_v3(database_.get(), kMove, sizeof kMove, 0, &prepared, nullptr) != SQLITE_OK)
+      return false;
+    const SqliteStatement statement(prepared);
+    return bind(prepared, 1, from) && bind(prepared, 2, to) && sql.step(prepared) == SQLITE_DONE;
+  }
+
+  static bool bind(sqlite3_stmt* statement, int index, std::string_view text) noexcept {
+    // The pointer of an empty view may be null, which would bind no value.
+    const char* const bytes = text.empty() ? "" : text.data();
+    return sqlite()->bind_text(statement, index, bytes, static_cast<int>(text.size()), SQLITE_STATIC) ==
+           SQLITE_OK;
+  }
+
+  const SqliteDatabase database_;
+  const std::chrono::milliseconds patience_;
+  const std::chrono::milliseconds longestRemap_;
+};
+
+struct Free {
+  void operator()(char* memory) const noexcept { std::free(memory); }
+};
+
+// The database's path with the home's own links resolved; those below it are their owner's and are not
+// followed. Empty when there is no home.
+std::string databasePath(const std::string& home) {
+  if (home.empty()) return {};
+  const std::unique_ptr<char, Free> resolved(::realpath(home.c_str(), nullptr));
+  return resolved == nullptr ? std::string() : std::string(resolved.get()) + kBelowHome;
+}
+
+// A file that answered with one of these will never be read as a database. Anything else (locked, damaged,
+// read-only) is for the remap to report.
+bool isHopeless(int result) noexcept {
+  switch (result & 0xFF) {
+    case SQLITE_NOTADB:
+    case SQLITE_CANTOPEN:
+    case SQLITE_IOERR:
+    case SQLITE_PERM:
+    case SQLITE_AUTH:
+    case SQLITE_NOMEM:
+      return true;
+    default:
+      return false;
+  }
+}
+
+SqliteDatabase open(const std::string& path) noexcept {
+  struct stat status {};
+  if (path.empty() || ::lstat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) return nullptr;
+  // The permission bits say what the owner wants; root obeys them, too.
+  if ((status.st_mode & (S_IRUSR | S_IRGRP | S_IROTH)) == 0) return nullptr;
+  const bool writable = (status.st_mode & (S_IWUSR | S_IWGRP | S_IWOTH)) != 0;
+  const SqliteFunctions* const sql = sqlite();
+  if (sql == nullptr) return nullptr;
+  sqlite3* opened = nullptr;
+  const int flags = (writable ? SQLITE_OPEN_READWRITE : SQLITE_OPEN_READONLY) | SQLITE_OPEN_NOFOLLOW |
+                    SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_PRIVATECACHE;
+  const int result = sql->open_v2(path.c_str(), &opened, flags, nullptr);
+  SqliteDatabase database(opened);  // to be closed even when opening failed
+  if (result != SQLITE_OK) return nullptr;
+  (void)sql->db_config(opened, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
+  (void)sql->db_config(opened, SQLITE_DBCONFIG_TRUSTED_SCHEMA, 0, nullptr);
+  // SQLite opens anything and reads nothing; the first pragma that needs the file tells whether it is a
+  // database. No waiting here: a locked one is a database.
+  if (isHopeless(sql->exec(opened, "PRAGMA schema_version", nullptr, nullptr, nullptr))) return nullptr;
+  (void)sql->exec(opened, "PRAGMA synchronous=FULL; PRAGMA cell_size_check=ON", nullptr, nullptr, nullptr);
+  return database;
+}
+
+}  // namespace
+
+std::unique_ptr<ContactsChannelManager> SqliteContacts::makeChannelManager() noexcept {
+  try {
+    SqliteDatabase database = open(databasePath(home_()));
+    if (database == nullptr) return nullptr;
+    return std::make_unique<SqliteChannelManager>(std::move(database), patience_, longestRemap_);
+  } catch (const std::bad_alloc&) {
+    return nullptr;
+  }
+}
+
+}  // namespace brenvik

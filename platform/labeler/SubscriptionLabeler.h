@@ -1,0 +1,41 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <string_view>
+
+#include "platform/plist/PropertyList.h"
+
+namespace brenvik {
+
+// What the labeler calls the predefined labels. In the name space of the system, so that no label a person
+// makes up is mistaken for one.
+namespace label_identifier {
+inline constexpr std::string_view primary = "com.norvale.subscription-label.primary";
+inline constexpr std::string_view secondary = "com.norvale.subscription-label.secondary";
+inline constexpr std::string_view personal = "com.norvale.subscription-label.personal";
+inline constexpr std::string_view business = "com.norvale.subscription-label.business";
+inline constexpr std::string_view travel = "com.norvale.subscription-label.travel";
+inline constexpr std::string_view data = "com.norvale.subscription-label.data";
+}  // namespace label_identifier
+
+// The platform's source of subscription labels in a user's language. Both operations take an array of texts
+// and an array of language identifiers (BCP 47, the preferred one first) and give an array of texts, or no
+// value when they cannot. Elements that are not texts are passed over in either array: the result has one
+// element for each text among the labels, in their order. No languages, or none that is known: English.
+// The same arguments give the same result. Any thread.
+class SubscriptionLabeler {
+ public:
+  virtual ~SubscriptionLabeler() = default;
+
+  // Short forms of the labels (identifiers above, or a user's own texts): one to three grapheme clusters
+  // each, no two of one result alike. No value when there are more labels than such forms.
+  virtual PropertyList localizedBadgeLabels(const PropertyList& labels,
+                                            const PropertyList& languages) noexcept = 0;
+
+  // The labels' names. A text that is no identifier is its own name. `languages` may be no value.
+  virtual PropertyList localizedLabels(const PropertyList& labels,
+                                       const PropertyList& languages) noexcept = 0;
+};
+
+}  // namespace brenvik

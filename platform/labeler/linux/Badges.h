@@ -1,0 +1,37 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <unordered_set>
+
+namespace brenvik {
+
+// Makes the badges of one request: short upper-case forms of labels, no two alike. A badge is the first
+// grapheme cluster (UAX 29) of its label; when that is taken, the first two, then three; then the first
+// cluster and a number from 2 to 99; then a number or a code of three characters that has nothing to do with
+// the label. Blanks and invisible characters never count. One object serves one request, on one thread.
+class Badges {
+ public:
+  // `language`: ISO 639 code, NUL-terminated; decides how letters become capitals. It outlives the object.
+  explicit Badges(const char* language) noexcept : language_(language) {}
+
+  // A badge for the label, which is UTF-8. Nothing once all forms are used up (after tens of thousands).
+  // Time and memory do not grow with the label beyond reading its leading blanks. Throws std::bad_alloc.
+  std::optional<std::string> make(std::string_view label);
+
+ private:
+  bool take(const std::string& badge) { return taken_.insert(badge).second; }
+  std::optional<std::string> takeCode();
+
+  const char* language_;
+  std::unordered_set<std::string> taken_;
+  std::unordered_map<std::string, int> nextNumber_;  // of a first cluster; all smaller ones are taken
+  std::uint32_t nextCode_ = 0;
+};
+
+}  // namespace brenvik

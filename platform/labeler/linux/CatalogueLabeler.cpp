@@ -1,0 +1,81 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/labeler/linux/CatalogueLabeler.h"
+
+#include <new>
+#include <optional>
+#include <utility>
+#include <vector>
+
+#include "platform/labeler/linux/Badges.h"
+#include "platform/labeler/linux/Catalogue.h"
+
+namespace brenvik {
+namespace {
+
+constexpr std::pair<std::string_view, Label> kIdentifiers[] = {
+    {label_identifier::primary, Label::primary},   {label_identifier::secondary, Label::secondary},
+    {label_identifier::personal, Label::personal}, {label_identifier::business, Label::business},
+    {label_identifier::travel, Label::travel},     {label_identifier::data, Label::data},
+};
+static_assert(std::size(kIdentifiers) == kLabelCount);
+
+// The first language of the list that any catalogue serves, each range followed to its end before the next.
+LabelCatalogue catalogueFor(const PropertyList& languages) noexcept {
+  for (std::size_t i = 0; i < languages.size(); ++i) {
+    const std::optional<std::string_view> range = languages.at(i).asString();
+    if (!range.has_value()) continue;
+    if (const catalogue::Catalogue* const found = LabelCatalogue::find(*range)) return LabelCatalogue(*found);
+  }
+  return {};
+}
+
+// A label's name in the language; a user's own text stays as it is.
+std::string_view nameOf(std::string_view label, const LabelCatalogue& catalogue) noexcept {
+  for (const auto& [identifier, predefined] : kIdentifiers) {
+    if (label == identifier) return catalogue.text(predefined);
+  }
+  return label;
+}
+
+// Calls `make` with each label's name and gathers the texts it returns; no value as soon as it returns
+// nothing.
+template <class Make>
+PropertyList textsFor(const PropertyList& labels, const LabelCatalogue& catalogue,
+                      const Make& make) noexcept {
+  try {
+    std::vector<PropertyList> texts;
+    texts.reserve(labels.size());
+    for (std::size_t i = 0; i < labels.size(); ++i) {
+      const PropertyList label = labels.at(i);
+      const std::optional<std::string_view> text = label.asString();
+      if (!text.has_value()) continue;
+      PropertyList made = make(nameOf(*text, catalogue));
+      if (!made.hasValue()) return {};
+      texts.push_back(std::move(made));
+    }
+    return PropertyList::array(std::move(texts));
+  } catch (const std::bad_alloc&) {
+    return {};
+  }
+}
+
+}  // namespace
+
+PropertyList CatalogueLabeler::localizedBadgeLabels(const PropertyList& labels,
+                                                    const PropertyList& languages) noexcept {
+  const LabelCatalogue catalogue = catalogueFor(languages);
+  Badges badges(catalogue.language());
+  return textsFor(labels, catalogue, [&badges](std::string_view name) {
+    const std::optional<std::string> badge = badges.make(name);
+    return badge.has_value() ? PropertyList::string(*badge) : PropertyList();
+  });
+}
+
+PropertyList CatalogueLabeler::localizedLabels(const PropertyList& labels,
+                                               const PropertyList& languages) noexcept {
+  return textsFor(labels, catalogueFor(languages),
+                  [](std::string_view name) { return PropertyList::string(name); });
+}
+
+}  // namespace brenvik

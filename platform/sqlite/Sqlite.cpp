@@ -1,0 +1,41 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/sqlite/Sqlite.h"
+
+#include <dlfcn.h>
+
+#include <mutex>
+
+namespace brenvik {
+namespace {
+
+constexpr char kLibrary[] = "libsqlite3.so.0";  // the name of its one binary interface since 2004
+
+template <class Function>
+bool look(void* library, const char* name, Function* function) noexcept {
+  *function = reinterpret_cast<Function>(::dlsym(library, name));
+  return *function != nullptr;
+}
+
+bool load(SqliteFunctions* functions) noexcept {
+  void* const library = ::dlopen(kLibrary, RTLD_NOW | RTLD_LOCAL);
+  if (library == nullptr) return false;
+#define BRENVIK_SQLITE_LOOK(name) &&look(library, "sqlite3_" #name, &functions->name)
+  if (true BRENVIK_SQLITE_FUNCTIONS(BRENVIK_SQLITE_LOOK)) return true;
+#undef BRENVIK_SQLITE_LOOK
+  ::dlclose(library);
+  return false;
+}
+
+}  // namespace
+
+const SqliteFunctions* sqlite() noexcept {
+  static std::mutex mutex;
+  static SqliteFunctions functions;
+  static bool loaded = false;
+  const std::lock_guard lock(mutex);
+  if (!loaded) loaded = load(&functions);
+  return loaded ? &functions : nullptr;
+}
+
+}  // namespace brenvik
