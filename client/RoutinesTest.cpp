@@ -50,7 +50,9 @@ std::string field(std::string text, std::size_t size) {
 
 Bytes success(const Message& request) { return statusReply(request, 0); }
 std::function<Bytes(const Message&)> boolean(char value) {
-  return [value](const Message& request) { return withResult(statusReply(request, 0), std::string{value, 0, 0, 0}); };
+  return [value](const Message& request) {
+    return withResult(statusReply(request, 0), std::string{value, 0, 0, 0});
+  };
 }
 std::function<Bytes(const Message&)> answerText(const char* text, std::size_t size) {
   return [=](const Message& request) { return withResult(statusReply(request, 0), field(text, size)); };
@@ -108,11 +110,12 @@ const std::vector<RoutineCase>& cases() {
   static const std::vector<RoutineCase> all{
       {"BVMobileHelperSetVoicemailToken", 8683549, simple(288).text(32, "tok\xC3\xA9n"), success,
        [](bvmh_client* c) { return BVMobileHelperSetVoicemailToken(c, "tok\xC3\xA9n"); }},
-      {"BVMobileHelperSetVoicemailTokenForKey", 8683550, simple(544).text(32, "key").text(288, "token"), success,
-       [](bvmh_client* c) { return BVMobileHelperSetVoicemailTokenForKey(c, "key", "token"); }},
+      {"BVMobileHelperSetVoicemailTokenForKey", 8683550, simple(544).text(32, "key").text(288, "token"),
+       success, [](bvmh_client* c) { return BVMobileHelperSetVoicemailTokenForKey(c, "key", "token"); }},
       {"BVMobileHelperClearVoicemailToken", 8683551, Bytes(24), success, BVMobileHelperClearVoicemailToken},
       {"BVMobileHelperResetVoicemailStore", 8683552, Bytes(24), success, BVMobileHelperResetVoicemailStore},
-      {"BVMobileHelperCopyVoicemailTokenForKey", 8683553, simple(288).text(32, "key"), answerText("value", 256),
+      {"BVMobileHelperCopyVoicemailTokenForKey", 8683553, simple(288).text(32, "key"),
+       answerText("value", 256),
        [](bvmh_client* c) {
          char token[BVMH_TOKEN_SIZE] = "?";
          const std::int32_t code = BVMobileHelperCopyVoicemailTokenForKey(c, "key", token, sizeof token);
@@ -148,14 +151,15 @@ const std::vector<RoutineCase>& cases() {
                     "<plist/>")},
       {"BVMobileHelperCopyAppPreferenceValue", 8683557, simple(544).text(32, "domain").text(288, "key"),
        answerRegion(""),
-       expectRegion([](auto* c, auto* r) { return BVMobileHelperCopyAppPreferenceValue(c, "domain", "key", r); }, "")},
+       expectRegion(
+           [](auto* c, auto* r) { return BVMobileHelperCopyAppPreferenceValue(c, "domain", "key", r); }, "")},
       {"BVMobileHelperReplaceCarrierSymlink", 8683558,
        simple(3104).text(32, "/target").text(1056, "/link").text(2080, "domain"), success,
        [](bvmh_client* c) { return BVMobileHelperReplaceCarrierSymlink(c, "/target", "/link", "domain"); }},
       {"BVMobileHelperCreateSymlink", 8683559, simple(2080).text(32, "/target").text(1056, "/link"), success,
        [](bvmh_client* c) { return BVMobileHelperCreateSymlink(c, "/target", "/link"); }},
-      {"BVMobileHelperRemoveCarrierFile", 8683560, simple(2080).text(32, "/file").text(1056, "domain"), success,
-       [](bvmh_client* c) { return BVMobileHelperRemoveCarrierFile(c, "/file", "domain"); }},
+      {"BVMobileHelperRemoveCarrierFile", 8683560, simple(2080).text(32, "/file").text(1056, "domain"),
+       success, [](bvmh_client* c) { return BVMobileHelperRemoveCarrierFile(c, "/file", "domain"); }},
       {"BVMobileHelperIsVoicemailServiceSubscribed", 8683561, Bytes(24), boolean(1),
        expectBoolean(BVMobileHelperIsVoicemailServiceSubscribed, true)},
       {"BVMobileHelperCellularHeartbeat", 8683562, integerRequest(-2), success,
@@ -164,19 +168,22 @@ const std::vector<RoutineCase>& cases() {
       {"BVMobileHelperCheckLASDUpdate", 8683563, integerRequest(31),
        [](const Message& request) { return statusReply(request, 0).u64(24, 0xFFFFFFFFFFFFFFFF); },
        [](bvmh_client* c) { return BVMobileHelperCheckLASDUpdate(c, 31); }},
-      {"BVMobileHelperCopyCarrierFile", 8683564, simple(800).text(32, "/from").text(288, "/to").text(544, "name"),
-       boolean(0),
-       expectBoolean([](auto* c, bool* b) { return BVMobileHelperCopyCarrierFile(c, "/from", "/to", "name", b); },
-                     false)},
+      {"BVMobileHelperCopyCarrierFile", 8683564,
+       simple(800).text(32, "/from").text(288, "/to").text(544, "name"), boolean(0),
+       expectBoolean(
+           [](auto* c, bool* b) { return BVMobileHelperCopyCarrierFile(c, "/from", "/to", "name", b); },
+           false)},
       {"BVMobileHelperCopyCrashLogs", 8683565, simple(288).text(32, "/logs"), boolean(1),
        expectBoolean([](auto* c, bool* b) { return BVMobileHelperCopyCrashLogs(c, "/logs", b); }, true)},
       {"BVMobileHelperMoveIntoCarrierBundles", 8683566,
        simple(800).text(32, "/source").text(288, "/destination").text(544, "name"), boolean(1),
        expectBoolean(
-           [](auto* c, bool* b) { return BVMobileHelperMoveIntoCarrierBundles(c, "/source", "/destination", "name", b); },
+           [](auto* c, bool* b) {
+             return BVMobileHelperMoveIntoCarrierBundles(c, "/source", "/destination", "name", b);
+           },
            true)},
-      {"BVMobileHelperRequestCountryCodeFromLocation", 8683567, simple(48).f64(32, 52.5).f64(40, -13.25), success,
-       [](bvmh_client* c) { return BVMobileHelperRequestCountryCodeFromLocation(c, 52.5, -13.25); }},
+      {"BVMobileHelperRequestCountryCodeFromLocation", 8683567, simple(48).f64(32, 52.5).f64(40, -13.25),
+       success, [](bvmh_client* c) { return BVMobileHelperRequestCountryCodeFromLocation(c, 52.5, -13.25); }},
       {"BVMobileHelperCopyCountryCode", 8683568, Bytes(24), answerText("DE", 64),
        [](bvmh_client* c) {
          char country[BVMH_COUNTRY_CODE_SIZE] = "?";
@@ -184,22 +191,29 @@ const std::vector<RoutineCase>& cases() {
          EXPECT_STREQ(country, "DE");
          return code;
        }},
-      {"BVMobileHelperRequestWanIPFromLocation", 8683569, Bytes(24), success, BVMobileHelperRequestWanIPFromLocation},
+      {"BVMobileHelperRequestWanIPFromLocation", 8683569, Bytes(24), success,
+       BVMobileHelperRequestWanIPFromLocation},
       {"BVMobileHelperEnableRadioManagerLogs", 8683570, integerRequest(2), success,
        [](bvmh_client* c) { return BVMobileHelperEnableRadioManagerLogs(c, 2); }},
       {"BVMobileHelperUnpackArchive", 8683571, simple(544).text(32, "/a.zip").text(288, "/to"), boolean(0),
-       expectBoolean([](auto* c, bool* b) { return BVMobileHelperUnpackArchive(c, "/a.zip", "/to", b); }, false)},
-      {"BVMobileHelperLoadPlistFile", 8683572, simple(288).text(32, "/a.plist"), answerRegion("<plist>x</plist>"),
+       expectBoolean([](auto* c, bool* b) { return BVMobileHelperUnpackArchive(c, "/a.zip", "/to", b); },
+                     false)},
+      {"BVMobileHelperLoadPlistFile", 8683572, simple(288).text(32, "/a.plist"),
+       answerRegion("<plist>x</plist>"),
        expectRegion([](auto* c, auto* r) { return BVMobileHelperLoadPlistFile(c, "/a.plist", r); },
                     "<plist>x</plist>")},
       {"BVMobileHelperCopyBadgeLabels", 8683573, labelsRequest("[label]", "[de]"), answerRegion("[B]"),
-       expectRegion([](auto* c, auto* r) { return BVMobileHelperCopyBadgeLabels(c, "[label]", 7, "[de]", 4, r); },
-                    "[B]")},
-      {"BVMobileHelperCopyLocalizedLabels", 8683574, labelsRequest("[eightby]", "[]"), answerRegion("[Haupt]"),
-       expectRegion([](auto* c, auto* r) { return BVMobileHelperCopyLocalizedLabels(c, "[eightby]", 9, "[]", 2, r); },
-                    "[Haupt]")},
+       expectRegion(
+           [](auto* c, auto* r) { return BVMobileHelperCopyBadgeLabels(c, "[label]", 7, "[de]", 4, r); },
+           "[B]")},
+      {"BVMobileHelperCopyLocalizedLabels", 8683574, labelsRequest("[eightby]", "[]"),
+       answerRegion("[Haupt]"),
+       expectRegion(
+           [](auto* c, auto* r) { return BVMobileHelperCopyLocalizedLabels(c, "[eightby]", 9, "[]", 2, r); },
+           "[Haupt]")},
       {"BVMobileHelperRemapContactsChannel", 8683575, simple(160).text(32, "from").text(96, "to"), boolean(1),
-       expectBoolean([](auto* c, bool* b) { return BVMobileHelperRemapContactsChannel(c, "from", "to", b); }, true)},
+       expectBoolean([](auto* c, bool* b) { return BVMobileHelperRemapContactsChannel(c, "from", "to", b); },
+                     true)},
   };
   return all;
 }

@@ -66,7 +66,13 @@ std::uint64_t Bytes::u64At(std::size_t offset) const {
 }
 
 Bytes statusReply(const Message& request, std::int32_t code) {
-  return Bytes(36).u32(0, 18).u32(4, 36).u32(12, request.replyPort()).i32(20, request.id() + 100).ndr(24).i32(32, code);
+  return Bytes(36)
+      .u32(0, 18)
+      .u32(4, 36)
+      .u32(12, request.replyPort())
+      .i32(20, request.id() + 100)
+      .ndr(24)
+      .i32(32, code);
 }
 
 Bytes withResult(Bytes status, std::string_view result) {
@@ -92,7 +98,8 @@ Bytes outOfLineReply(const Message& request, std::uint32_t size, std::uint64_t a
 }
 
 Bytes inLineReply(const Message& request, std::string_view region) {
-  return outOfLineReply(request, static_cast<std::uint32_t>(region.size()), region.empty() ? 0 : 56).append(region);
+  return outOfLineReply(request, static_cast<std::uint32_t>(region.size()), region.empty() ? 0 : 56)
+      .append(region);
 }
 
 Bytes checkInReply(const Message& request) {
@@ -107,7 +114,8 @@ Bytes checkInReply(const Message& request) {
 
 UniqueFd makeMemory(std::string_view content, int seals) {
   UniqueFd memory = checked(::memfd_create("test", MFD_CLOEXEC | MFD_ALLOW_SEALING), "memfd_create");
-  if (::write(memory.get(), content.data(), content.size()) != static_cast<ssize_t>(content.size())) fail("write");
+  if (::write(memory.get(), content.data(), content.size()) != static_cast<ssize_t>(content.size()))
+    fail("write");
   if (seals != 0 && ::fcntl(memory.get(), F_ADD_SEALS, seals) != 0) fail("F_ADD_SEALS");
   return memory;
 }
@@ -190,7 +198,8 @@ ScriptedHelper::ScriptedHelper(std::function<void(Script&)> script) {
   path_ = directory_ + "/socket";
   listening_ = checked(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0), "socket");
   const sockaddr_un address = addressOf(path_);
-  if (::bind(listening_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) fail("bind");
+  if (::bind(listening_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
+    fail("bind");
   if (::listen(listening_.get(), 8) != 0) fail("listen");
   thread_ = std::thread([this, script = std::move(script)] {
     try {
