@@ -14,7 +14,7 @@
 #include <cstring>
 
 #include "interface/Messages.h"
-#include "interface/Pushes.h"
+#include "interface/TelephonyMessages.h"
 
 namespace brenvik::client {
 namespace {
@@ -241,10 +241,11 @@ bool Listener::readPush(const Connection& connection, bvmh_event* event, std::in
     return false;
   };
   if (incoming_.isCut) return refused(mig::badArguments);
-  if (header.id != kSetCivicInfoId && header.id != kSetLocalRoutableAddressId) return refused(mig::badId);
-  if ((header.bits & kComplexBit) == 0 || datagram.size() < sizeof(PushRequest))
+  if (header.id != kSetCivicInfoMessageId && header.id != kSetLocalRoutableAddressMessageId)
+    return refused(mig::badId);
+  if ((header.bits & kComplexBit) == 0 || datagram.size() < sizeof(TelephonyPushMessage))
     return refused(mig::badArguments);
-  const auto request = readAs<PushRequest>(datagram);
+  const auto request = readAs<TelephonyPushMessage>(datagram);
   if (request.descriptorCount != 1) return refused(mig::badArguments);
   if (request.values.type != kOutOfLineDescriptorType) return refused(mig::typeError);
   const auto place = placeOfRegion(datagram, sizeof request, request.values, incoming_);
@@ -256,7 +257,7 @@ bool Listener::readPush(const Connection& connection, bvmh_event* event, std::in
     *code = taken;
     return true;
   }
-  event->kind = header.id == kSetCivicInfoId ? BVMH_EVENT_CIVIC_INFO : BVMH_EVENT_LOCAL_ADDRESS;
+  event->kind = header.id == kSetCivicInfoMessageId ? BVMH_EVENT_CIVIC_INFO : BVMH_EVENT_LOCAL_ADDRESS;
   event->payload = region;
   event->wants_reply = header.replyPort != kNullPort;
   event->connection = connection.serial;
@@ -268,8 +269,8 @@ bool Listener::readPush(const Connection& connection, bvmh_event* event, std::in
 bool Listener::readNotification(const Connection& connection, bvmh_event* event,
                                 std::int32_t* code) noexcept {
   const auto header = readAs<MessageHeader>(buffer_.bytes());
-  if (header.id != kNotificationId || incoming_.isCut || incoming_.descriptorCount != 0) {
-    refuse(connection, header, header.id != kNotificationId ? mig::badId : mig::badArguments);
+  if (header.id != kNotificationMessageId || incoming_.isCut || incoming_.descriptorCount != 0) {
+    refuse(connection, header, header.id != kNotificationMessageId ? mig::badId : mig::badArguments);
     return false;
   }
   RegionPlace place;
@@ -286,12 +287,11 @@ std::int32_t Listener::reply(const bvmh_event& event, std::int32_t domain, std::
     return each.socket.isValid() && each.serial == event.connection;
   });
   if (connection == connections_.end()) return BVMH_ERROR_NO_LONGER_THERE;
-  PushReply reply{};
+  TelephonyPushReply reply{};
   reply.header = replyHeader(sizeof reply, event.reply_port, event.message_id);
   reply.ndr = kNdrRecord;
   reply.returnCode = code;
-  reply.errorDomain = static_cast<std::uint32_t>(domain);
-  reply.errorCode = static_cast<std::uint32_t>(code);
+  reply.result = std::uint64_t{static_cast<std::uint32_t>(code)} << 32 | static_cast<std::uint32_t>(domain);
   return sendReply(connection->socket.get(), reply) ? BVMH_OK : BVMH_ERROR_NO_LONGER_THERE;
 }
 
