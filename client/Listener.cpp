@@ -1,0 +1,298 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "client/Listener.h"
+
+#include <sys/epoll.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include "interface/Messages.h"
+#include "interface/TelephonyMessages.h"
+
+namespace brenvik::client {
+namespace {
+
+constexpr int kBacklog = 16;
+
+// How many connections and broken messages are still dealt with when the time is over already, so that
+// neither a flood nor a time-out of 0 makes the other useless.
+constexpr int kMostOvertime = 64;
+
+// Events of the services carry 0 and 1, those of a connection its index and this.
+constexpr std::uint64_t kFirstConnectionKey = 2;
+
+template <class Message>
+Message readAs(std::span<const std::byte> datagram) noexcept {
+  Message message;
+  std::memcpy(&message, datagram.data(), sizeof message);
+  return message;
+}
+
+// False with errno set. What is there already stays as it is.
+bool makeDirectories(const char* path) noexcept {
+  char copy[sizeof(sockaddr_un::sun_path)];
+  const std::size_t length = ::strnlen(path, sizeof copy);
+  if (length == sizeof copy) {
+    errno = ENAMETOOLONG;
+    return false;
+  }
+  std::memcpy(copy, path, length + 1);
+  for (std::size_t i = 1; i <= length; ++i) {
+    if (copy[i] != '/' && copy[i] != '\0') continue;
+    const char ended = std::exchange(copy[i], '\0');
+    if (::mkdir(copy, 0755) != 0 && errno != EEXIST) return false;
+    copy[i] = ended;
+  }
+  return true;
+}
+
+template <class Reply>
+bool sendReply(int socket, const Reply& reply) noexcept {
+  const std::array parts{iovec{const_cast<Reply*>(&reply), sizeof reply}};  // sending only reads
+  Waiting next = Waiting::byPoll;
+  // A peer that does not read its answers does not get to hold us up.
+  return sendMessage(socket, parts, {}, Deadline::in(std::chrono::milliseconds(0)), &next) == Io::done;
+}
+
+MessageHeader replyHeader(std::uint32_t size, PortName replyPort, std::int32_t requestId) noexcept {
+  return {kReplyDisposition, size, kNullPort, replyPort, 0, requestId + kReplyIdOffset};
+}
+
+}  // namespace
+
+ServiceSocket::~ServiceSocket() {
+  if (!socket_.isValid()) return;
+  struct stat facts {};
+  if (::lstat(address_.sun_path, &facts) == 0 && facts.st_dev == device_ && facts.st_ino == inode_) {
+    ::unlink(address_.sun_path);
+  }
+}
+
+std::int32_t ServiceSocket::listenAt(const char* directory, const char* name) noexcept {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  const int length = std::snprintf(address.sun_path, sizeof address.sun_path, "%s/%s", directory, name);
+  if (length < 0 || static_cast<std::size_t>(length) >= sizeof address.sun_path)
+    return BVMH_ERROR_INVALID_ARGUMENT;
+  if (!makeDirectories(directory)) return BVMH_ERROR_SYSTEM;
+  const auto* generic = reinterpret_cast<const sockaddr*>(&address);
+
+  UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  if (!socket.isValid()) return BVMH_ERROR_SYSTEM;
+  if (::bind(socket.get(), generic, sizeof address) != 0) {
+    if (errno != EADDRINUSE) return BVMH_ERROR_SYSTEM;
+    // Somebody's file: a live owner takes the connection, a dead one's refuses it.
+    const UniqueFd probe(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+    if (!probe.isValid()) return BVMH_ERROR_SYSTEM;
+    if (::connect(probe.get(), generic, sizeof address) == 0 || errno != ECONNREFUSED)
+      return BVMH_ERROR_NAME_IN_USE;
+    if (::unlink(address.sun_path) != 0 && errno != ENOENT) return BVMH_ERROR_SYSTEM;
+    if (::bind(socket.get(), generic, sizeof address) != 0) {
+      return errno == EADDRINUSE ? BVMH_ERROR_NAME_IN_USE : BVMH_ERROR_SYSTEM;
+    }
+  }
+  struct stat facts {};
+  // Anyone may connect, whatever the umask; who may speak is decided by the credentials of the connection.
+  if (::lstat(address.sun_path, &facts) != 0 || ::chmod(address.sun_path, 0666) != 0 ||
+      ::listen(socket.get(), kBacklog) != 0) {
+    const int error = errno;
+    ::unlink(address.sun_path);
+    errno = error;
+    return BVMH_ERROR_SYSTEM;
+  }
+  socket_ = std::move(socket);
+  address_ = address;
+  device_ = facts.st_dev;
+  inode_ = facts.st_ino;
+  return BVMH_OK;
+}
+
+std::int32_t Listener::systemFailure() noexcept {
+  systemError_ = errno;
+  return BVMH_ERROR_SYSTEM;
+}
+
+std::int32_t Listener::open(const char* directory, unsigned services) noexcept {
+  systemError_ = 0;
+  if (!buffer_.ensure()) return BVMH_ERROR_NO_MEMORY;
+  poll_.reset(::epoll_create1(EPOLL_CLOEXEC));
+  if (!poll_.isValid()) return systemFailure();
+  struct Named {
+    unsigned bit;
+    Service service;
+    const char* name;
+  };
+  for (const Named& each : {Named{BVMH_PUSHES, Service::pushes, kTelephonyServiceName},
+                            Named{BVMH_NOTIFICATIONS, Service::notifications, kNotificationServiceName}}) {
+    if ((services & each.bit) == 0) continue;
+    ServiceSocket& socket = services_[static_cast<std::size_t>(each.service)];
+    const std::int32_t code = socket.listenAt(directory, each.name);
+    if (code == BVMH_ERROR_SYSTEM) return systemFailure();
+    if (code != BVMH_OK) return code;
+    epoll_event event{};
+    event.events = EPOLLIN;
+    event.data.u64 = static_cast<std::uint64_t>(each.service);
+    if (::epoll_ctl(poll_.get(), EPOLL_CTL_ADD, socket.get(), &event) != 0) return systemFailure();
+  }
+  return BVMH_OK;
+}
+
+std::int32_t Listener::accept(Service service) noexcept {
+  UniqueFd socket(::accept4(services_[static_cast<std::size_t>(service)].get(), nullptr, nullptr,
+                            SOCK_CLOEXEC | SOCK_NONBLOCK));
+  if (!socket.isValid()) {
+    const bool isOver = errno == EAGAIN || errno == EINTR || errno == ECONNABORTED;
+    return isOver ? BVMH_OK : systemFailure();
+  }
+  ucred peer{};
+  socklen_t size = sizeof peer;
+  if (::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0 ||
+      (peer.uid != 0 && peer.uid != ::geteuid() && peer.uid != allowedUid_)) {
+    return BVMH_OK;
+  }
+  // All places taken: the oldest connection has had its time.
+  const auto place = std::min_element(
+      connections_.begin(), connections_.end(), [](const Connection& a, const Connection& b) {
+        return (a.socket.isValid() ? a.serial : 0) < (b.socket.isValid() ? b.serial : 0);
+      });
+  *place = Connection{std::move(socket), service, ++lastSerial_, peer.uid, peer.pid};
+  epoll_event event{};
+  event.events = EPOLLIN;
+  event.data.u64 = kFirstConnectionKey + static_cast<std::uint64_t>(place - connections_.begin());
+  if (::epoll_ctl(poll_.get(), EPOLL_CTL_ADD, place->socket.get(), &event) != 0) {
+    const std::int32_t code = systemFailure();
+    *place = Connection{};
+    return code;
+  }
+  return BVMH_OK;
+}
+
+std::int32_t Listener::next(Deadline deadline, bvmh_event* event) noexcept {
+  *event = bvmh_event{};
+  systemError_ = 0;
+  for (int overtime = 0;; overtime += deadline.hasPassed() ? 1 : 0) {
+    if (overtime > kMostOvertime) return BVMH_ERROR_TIMED_OUT;
+    epoll_event ready{};
+    const int count = ::epoll_wait(poll_.get(), &ready, 1, deadline.millisecondsForPoll());
+    if (count < 0 && errno != EINTR) return systemFailure();
+    if (count <= 0) {
+      if (deadline.hasPassed()) return BVMH_ERROR_TIMED_OUT;
+      continue;
+    }
+    std::int32_t code = BVMH_OK;
+    if (ready.data.u64 < kFirstConnectionKey) {
+      code = accept(static_cast<Service>(ready.data.u64));
+      if (code != BVMH_OK) return code;
+      continue;
+    }
+    if (read(connections_[ready.data.u64 - kFirstConnectionKey], event, &code)) return code;
+  }
+}
+
+bool Listener::read(Connection& connection, bvmh_event* event, std::int32_t* code) noexcept {
+  if (!buffer_.ensure()) {
+    *code = BVMH_ERROR_NO_MEMORY;
+    return true;
+  }
+  const Deadline now = Deadline::in(std::chrono::milliseconds(0));
+  switch (receiveMessage(connection.socket.get(), buffer_.bytes(), now, Waiting::byPoll, &incoming_)) {
+    case Io::done:
+      break;
+    case Io::timedOut:
+      return false;
+    default:
+      connection = Connection{};
+      return false;
+  }
+  const bool isForCaller =
+      incoming_.length >= sizeof(MessageHeader) &&
+      (connection.service == Service::pushes ? readPush(connection, event, code)
+                                             : readNotification(connection, event, code));
+  incoming_ = Incoming{};
+  if (isForCaller) {
+    event->sender_uid = connection.uid;
+    event->sender_pid = connection.pid;
+  }
+  return isForCaller;
+}
+
+void Listener::refuse(const Connection& connection, const MessageHeader& request,
+                      KernelReturn code) noexcept {
+  if (request.replyPort == kNullPort) return;
+  StatusReply reply{};
+  reply.header = replyHeader(sizeof reply, request.replyPort, request.id);
+  reply.ndr = kNdrRecord;
+  reply.returnCode = code;
+  (void)sendReply(connection.socket.get(), reply);  // a sender that has gone wants no answer
+}
+
+bool Listener::readPush(const Connection& connection, bvmh_event* event, std::int32_t* code) noexcept {
+  const std::span<const std::byte> datagram = buffer_.bytes().first(incoming_.length);
+  const auto header = readAs<MessageHeader>(datagram);
+  const auto refused = [&](KernelReturn refusal) {
+    refuse(connection, header, refusal);
+    return false;
+  };
+  if (incoming_.isCut) return refused(mig::badArguments);
+  if (header.id != kSetCivicInfoMessageId && header.id != kSetLocalRoutableAddressMessageId)
+    return refused(mig::badId);
+  if ((header.bits & kComplexBit) == 0 || datagram.size() < sizeof(TelephonyPushMessage))
+    return refused(mig::badArguments);
+  const auto request = readAs<TelephonyPushMessage>(datagram);
+  if (request.descriptorCount != 1) return refused(mig::badArguments);
+  if (request.values.type != kOutOfLineDescriptorType) return refused(mig::typeError);
+  const auto place = placeOfRegion(datagram, sizeof request, request.values, incoming_);
+  if (!place) return refused(mig::badArguments);
+  bvmh_region region{};
+  const std::int32_t taken = takeRegion(*place, buffer_, incoming_, &region);
+  if (taken == BVMH_ERROR_PROTOCOL) return refused(mig::badArguments);
+  if (taken != BVMH_OK) {
+    *code = taken;
+    return true;
+  }
+  event->kind = header.id == kSetCivicInfoMessageId ? BVMH_EVENT_CIVIC_INFO : BVMH_EVENT_LOCAL_ADDRESS;
+  event->payload = region;
+  event->wants_reply = header.replyPort != kNullPort;
+  event->connection = connection.serial;
+  event->reply_port = header.replyPort;
+  event->message_id = header.id;
+  return true;
+}
+
+bool Listener::readNotification(const Connection& connection, bvmh_event* event,
+                                std::int32_t* code) noexcept {
+  const auto header = readAs<MessageHeader>(buffer_.bytes());
+  if (header.id != kNotificationMessageId || incoming_.isCut || incoming_.descriptorCount != 0) {
+    refuse(connection, header, header.id != kNotificationMessageId ? mig::badId : mig::badArguments);
+    return false;
+  }
+  RegionPlace place;
+  place.size = static_cast<std::uint32_t>(incoming_.length - sizeof header);
+  place.offset = sizeof header;
+  *code = takeRegion(place, buffer_, incoming_, &event->payload);
+  event->kind = BVMH_EVENT_NOTIFICATION;
+  return true;
+}
+
+std::int32_t Listener::reply(const bvmh_event& event, std::int32_t domain, std::int32_t code) noexcept {
+  if (!event.wants_reply) return BVMH_ERROR_INVALID_ARGUMENT;
+  const auto connection = std::find_if(connections_.begin(), connections_.end(), [&](const Connection& each) {
+    return each.socket.isValid() && each.serial == event.connection;
+  });
+  if (connection == connections_.end()) return BVMH_ERROR_NO_LONGER_THERE;
+  TelephonyPushReply reply{};
+  reply.header = replyHeader(sizeof reply, event.reply_port, event.message_id);
+  reply.ndr = kNdrRecord;
+  reply.returnCode = code;
+  reply.result = std::uint64_t{static_cast<std::uint32_t>(code)} << 32 | static_cast<std::uint32_t>(domain);
+  return sendReply(connection->socket.get(), reply) ? BVMH_OK : BVMH_ERROR_NO_LONGER_THERE;
+}
+
+}  // namespace brenvik::client

@@ -1,0 +1,74 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <sys/types.h>
+#include <sys/un.h>
+
+#include <array>
+#include <cstdint>
+
+#include "client/Region.h"
+
+namespace brenvik::client {
+
+// The socket file of a named service, removed again as long as it is still ours.
+class ServiceSocket {
+ public:
+  ServiceSocket() = default;
+  ServiceSocket(const ServiceSocket&) = delete;
+  ServiceSocket& operator=(const ServiceSocket&) = delete;
+  ~ServiceSocket();
+  // Replaces a file that nobody serves. Codes of mobile_helper.h; errno stands after BVMH_ERROR_SYSTEM.
+  std::int32_t listenAt(const char* directory, const char* name) noexcept;
+  int get() const noexcept { return socket_.get(); }
+
+ private:
+  UniqueFd socket_;
+  sockaddr_un address_{};
+  dev_t device_ = 0;
+  ino_t inode_ = 0;
+};
+
+// The telephony daemon's two services, read from one place. One thread at a time.
+class Listener {
+ public:
+  std::int32_t open(const char* directory, unsigned services) noexcept;
+  int descriptor() const noexcept { return poll_.get(); }
+  int systemError() const noexcept { return systemError_; }
+  void allow(uid_t uid) noexcept { allowedUid_ = uid; }
+  std::int32_t next(Deadline deadline, bvmh_event* event) noexcept;
+  std::int32_t reply(const bvmh_event& event, std::int32_t domain, std::int32_t code) noexcept;
+
+ private:
+  enum class Service : std::uint8_t { pushes, notifications };
+  // The helper opens a connection for each push or notification, so few are ever open at once.
+  static constexpr std::size_t kMostConnections = 32;
+
+  struct Connection {
+    UniqueFd socket;
+    Service service = Service::pushes;
+    std::uint64_t serial = 0;  // never used twice
+    uid_t uid = 0;
+    pid_t pid = 0;
+  };
+
+  std::int32_t systemFailure() noexcept;
+  std::int32_t accept(Service service) noexcept;
+  // Reads one message; true when it was one for the caller.
+  bool read(Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;
+  bool readPush(const Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;
+  bool readNotification(const Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;
+  void refuse(const Connection& connection, const MessageHeader& request, KernelReturn code) noexcept;
+
+  UniqueFd poll_;
+  std::array<ServiceSocket, 2> services_;
+  std::array<Connection, kMostConnections> connections_;
+  std::uint64_t lastSerial_ = 0;
+  uid_t allowedUid_ = 0;  // beside the superuser and our own
+  int systemError_ = 0;
+  Buffer buffer_;
+  Incoming incoming_;
+};
+
+}  // namespace brenvik::client
