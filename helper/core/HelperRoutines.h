@@ -3,6 +3,8 @@
 #pragma once
 
 #include "helper/core/UnbuiltRoutines.h"
+#include "helper/labels/ChannelRemap.h"
+#include "helper/labels/LabelRoutines.h"
 #include "helper/mobile/RadioLogging.h"
 #include "helper/preferences/PreferenceTransfer.h"
 
@@ -15,6 +17,8 @@ class HelperRoutines final : public UnbuiltRoutines {
   struct Areas {
     PreferenceTransfer& preferences;
     RadioLogging& radioLogging;
+    LabelRoutines& labels;
+    ChannelRemap& channelRemap;
   };
   explicit HelperRoutines(const Areas& areas) noexcept : areas_(areas) {}
 
@@ -35,6 +39,20 @@ class HelperRoutines final : public UnbuiltRoutines {
   }
   KernelReturn server_BVMobileHelperEnableRadioManagerLogs(PortName port, std::int32_t enable) override {
     return areas_.radioLogging.BVMobileHelperEnableRadioManagerLogs(port, enable);
+  }
+  KernelReturn server_BVMobileHelperCopyBadgeLabels(PortName, const void* labels, std::uint32_t labelsLength,
+                                                    const void* languages, std::uint32_t languagesLength,
+                                                    OutOfLinePayload* badges) override {
+    return areas_.labels.CopyBadgeLabels(labels, labelsLength, languages, languagesLength, badges);
+  }
+  KernelReturn server_BVMobileHelperCopyLocalizedLabels(PortName, const void* labels, std::uint32_t labelsLength,
+                                                        const void* languages, std::uint32_t languagesLength,
+                                                        OutOfLinePayload* texts) override {
+    return areas_.labels.CopyLocalizedLabels(labels, labelsLength, languages, languagesLength, texts);
+  }
+  KernelReturn server_BVMobileHelperRemapContactsChannel(PortName, char* from, char* to,
+                                                         std::uint8_t* success) override {
+    return areas_.channelRemap.RemapContactsChannel(from, to, success);
   }
 
  private:

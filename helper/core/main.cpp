@@ -8,14 +8,20 @@
 #include <algorithm>
 #include <csignal>
 #include <cstdio>
+#include <exception>
+#include <string>
 
 #include "helper/core/EntryPoint.h"
 #include "helper/core/HelperRoutines.h"
+#include "helper/entitlement/EntitlementCheck.h"
+#include "helper/mobile/MobileUser.h"
 #include "helper/requests/RequestTable.h"
 #include "platform/accounts/linux/PasswordDatabase.h"
 #include "platform/baseband/linux/LoadedBasebandLibrary.h"
+#include "platform/contacts/linux/SqliteContacts.h"
 #include "platform/ipc/linux/SystemBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
+#include "platform/labeler/linux/CatalogueLabeler.h"
 #include "platform/log/linux/SystemLog.h"
 #include "platform/preferences/linux/FilePreferences.h"
 #include "platform/radio/linux/ModemManagerLogs.h"
@@ -51,7 +57,13 @@ int run() {
   }
   SystemQueues queues(*loop);
   PasswordDatabase accounts;
+  MobileUser& mobile = MobileUser::processWide(accounts);
+  const auto mobileHome = [&mobile] {
+    const char* const home = mobile.homeDirectory();
+    return std::string(home != nullptr ? home : "");
+  };
   EntitlementFiles security(accounts);
+  EntitlementCheck entitlements(security, queues);
 
   SystemPortSpace ports;
   SystemRegions regions;
@@ -64,13 +76,19 @@ int run() {
   ModemManagerLogs radio(queues);
   RadioLogging radioLogging(radio);
 
-  HelperRoutines routines({.preferences = preferenceTransfer, .radioLogging = radioLogging});
+  CatalogueLabeler labeler;
+  LabelRoutines labels(labeler, regions);
+  SqliteContacts contacts(mobileHome);
+  ChannelRemap channelRemap(contacts);
+
+  HelperRoutines routines({.preferences = preferenceTransfer,
+                           .radioLogging = radioLogging,
+                           .labels = labels,
+                           .channelRemap = channelRemap});
   const RequestTable requests(routines);
   const ServerPlatform platform{ports, bootstrap, sources, *loop,
-                                [&](const char* entitlement, const AuditToken& caller) {
-                                  const auto task = security.makeTask(caller);
-                                  return task != nullptr &&
-                                         task->copyEntitlement(entitlement).value.asBoolean().value_or(false);
+                                [&entitlements](const char* entitlement, const AuditToken& caller) {
+                                  return entitlements.HasEntitlement(entitlement, caller);
                                 }};
   const int status = runHelper(baseband, platform, requests);
   setLogSink(nullptr);
