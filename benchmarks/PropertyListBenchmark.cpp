@@ -50,7 +50,7 @@ PropertyList mixedDocument() {
          {"SupportsRoaming", PropertyList::boolean(below(2) == 0)},
          {"SignalThreshold", PropertyList::real(-static_cast<double>(below(120000)) / 1000)},
          {"LastUpdated", PropertyList::date(static_cast<double>(below(800000000)))},
-         {"Ports", PropertyList::array(std::move(ports))},
+         {"Ports", PropertyList::array(ports)},
          {"Certificate", PropertyList::data(std::as_bytes(std::span(blob)))},
          {"Gateway",
           PropertyList::dictionary({{"Address", text(20)},
@@ -59,7 +59,7 @@ PropertyList mixedDocument() {
     size += serializePropertyList(record, PropertyListFormat::xml).value().size() - 150;
     records.emplace_back("com.norvale.bundle." + std::to_string(records.size()), std::move(record));
   }
-  return PropertyList::dictionary(std::move(records));
+  return PropertyList::dictionary(records);
 }
 
 struct Documents {

@@ -470,7 +470,7 @@ TEST(BinaryWriterTest, WidthsOfOffsetsAndReferencesGrowWithTheDocument) {
     std::vector<PropertyList> elements;
     for (std::size_t i = 0; i < count; ++i)
       elements.push_back(PropertyList::integer(static_cast<std::int64_t>(i)));
-    const PropertyList value = PropertyList::array(std::move(elements));
+    const PropertyList value = PropertyList::array(elements);
     const std::string written = writtenAsBinary(value);
     EXPECT_EQ(written[written.size() - 25], count < 256 ? 1 : count < 65536 ? 2 : 4) << count;
     EXPECT_EQ(parse(written), value) << count;

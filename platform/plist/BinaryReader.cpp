@@ -90,7 +90,7 @@ class Reader {
   PropertyList read();
 
  private:
-  static constexpr std::size_t kFirstBlock = 64 * 1024;
+  static constexpr std::size_t kFirstBlock = std::size_t{64} << 10;
 
   // What is known of an object of the file.
   struct Slot {

@@ -13,7 +13,7 @@ namespace brenvik::plist {
 namespace {
 
 // Blocks grow with the document up to this, so that little is left unused at the end of a large one.
-constexpr std::size_t kLargestStep = 256 * 1024;
+constexpr std::size_t kLargestStep = std::size_t{256} << 10;
 constexpr std::size_t kSmallestStep = 512;
 
 struct Secret {

@@ -34,7 +34,7 @@ class Document {
 
   // Aligned for Node.
   void* allocate(std::size_t bytes) {
-    cursor_ = reinterpret_cast<char*>((reinterpret_cast<std::uintptr_t>(cursor_) + 7) & ~std::uintptr_t{7});
+    cursor_ += -reinterpret_cast<std::uintptr_t>(cursor_) & 7;  // may pass the end, where there is no room
     if (room() < bytes) grow(bytes);
     return std::exchange(cursor_, cursor_ + bytes);
   }

@@ -82,7 +82,7 @@ PropertyList sample() {
                                                     PropertyList::string(std::string(300, '<') + name),
                                                     PropertyList::array({PropertyList::date(i)})}));
   }
-  return PropertyList::dictionary(std::move(entries));
+  return PropertyList::dictionary(entries);
 }
 
 class MemoryExhaustionTest : public testing::TestWithParam<PropertyListFormat> {};
@@ -153,8 +153,8 @@ TEST(MemoryExhaustionTest, BuildingGivesTheValueOrNone) {
         elements = {part, whole};
         entries = {{"part", part}, {"whole", whole}};
         armed = wasArmed;
-        const PropertyList array = PropertyList::array(std::move(elements));
-        made = PropertyList::dictionary(std::move(entries));
+        const PropertyList array = PropertyList::array(elements);
+        made = PropertyList::dictionary(entries);
         return array && made;
       },
       [&] { return made.find("whole") == whole; });

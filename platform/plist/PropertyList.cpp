@@ -224,7 +224,7 @@ PropertyList PropertyList::data(std::span<const std::byte> bytes) noexcept {
   return textValue(Tag::data, reinterpret_cast<const char*>(bytes.data()), bytes.size());
 }
 
-PropertyList PropertyList::array(std::vector<PropertyList> elements) noexcept {
+PropertyList PropertyList::array(const std::vector<PropertyList>& elements) noexcept {
   std::size_t count = 0;
   std::size_t room = 0;
   for (const PropertyList& element : elements) {
@@ -249,7 +249,8 @@ PropertyList PropertyList::array(std::vector<PropertyList> elements) noexcept {
   }
 }
 
-PropertyList PropertyList::dictionary(std::vector<std::pair<std::string, PropertyList>> entries) noexcept {
+PropertyList PropertyList::dictionary(
+    const std::vector<std::pair<std::string, PropertyList>>& entries) noexcept {
   std::size_t count = 0;
   std::size_t room = 0;
   for (const auto& [key, value] : entries) {

@@ -40,11 +40,12 @@ class PropertyList {
   static PropertyList real(double value) noexcept;
   static PropertyList string(std::string_view utf8) noexcept;  // no value when it is not valid UTF-8
   static PropertyList data(std::span<const std::byte> bytes) noexcept;
-  static PropertyList date(double secondsSince2001) noexcept;              // since 2001-01-01T00:00:00Z
-  static PropertyList array(std::vector<PropertyList> elements) noexcept;  // absent elements are left out
+  static PropertyList date(double secondsSince2001) noexcept;  // since 2001-01-01T00:00:00Z
+  static PropertyList array(
+      const std::vector<PropertyList>& elements) noexcept;  // absent elements are left out
   // Keys in the order given; of equal keys the last value stands. Absent values are left out. No value when
   // a key is not valid UTF-8.
-  static PropertyList dictionary(std::vector<std::pair<std::string, PropertyList>> entries) noexcept;
+  static PropertyList dictionary(const std::vector<std::pair<std::string, PropertyList>>& entries) noexcept;
 
   // A dictionary with the entry set (in its old place, or last) or, with an absent value, without it. Costs
   // one pass over the entries. No value when this is not a dictionary or the key is not valid UTF-8.

@@ -120,7 +120,7 @@ TEST(PropertyListTest, OfEqualKeysTheFirstPlaceAndTheLastValueStand) {
       for (int i = 0; i < distinct * times; ++i) {
         entries.emplace_back("key" + std::to_string(i % distinct), PropertyList::integer(i));
       }
-      const PropertyList value = PropertyList::dictionary(std::move(entries));
+      const PropertyList value = PropertyList::dictionary(entries);
       ASSERT_EQ(value.size(), static_cast<std::size_t>(distinct));
       for (int i = 0; i < distinct; ++i) {
         const auto index = static_cast<std::size_t>(i);
@@ -138,7 +138,7 @@ TEST(PropertyListTest, FindsEveryKeyOfEveryLengthAndNoOther) {
   for (std::size_t length = 0; length < 70; ++length) {
     entries.emplace_back(std::string(length, 'k'), PropertyList::integer(static_cast<std::int64_t>(length)));
   }
-  const PropertyList value = PropertyList::dictionary(std::move(entries));
+  const PropertyList value = PropertyList::dictionary(entries);
   for (std::size_t length = 0; length < 70; ++length) {
     std::string key(length, 'k');
     EXPECT_EQ(value.find(key).asInteger(), static_cast<std::int64_t>(length));
@@ -299,9 +299,9 @@ TEST(PropertyListTest, ManySharedThingsThatMeetInManyPairsAreComparedInLinearTim
     for (std::size_t row = 0; row < 300; ++row) {
       std::vector<PropertyList> cells;
       for (std::size_t i = 0; i < kThings; ++i) cells.push_back(things[(i * (shift * row + 1)) % kThings]);
-      rows.push_back(PropertyList::array(std::move(cells)));
+      rows.push_back(PropertyList::array(cells));
     }
-    return PropertyList::array(std::move(rows));
+    return PropertyList::array(rows);
   };
   EXPECT_EQ(side(0), side(7));
 }

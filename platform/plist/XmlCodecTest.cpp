@@ -288,7 +288,12 @@ TEST(XmlReaderTest, ReadsEmptyElementsInBothForms) {
 }
 
 TEST(XmlReaderTest, RefusesElementsInTheWrongPlaceAndUnknownOnes) {
-  for (const char* bad : {"<key>a</key>",
+  for (const char* bad : {"<>a</>",
+                          "< >a</ >",
+                          "<></>",
+                          "< />",
+                          "</>",
+                          "<key>a</key>",
                           "<array><key>a</key></array>",
                           "<dict><string>a</string></dict>",
                           "<dict><key>a</key></dict>",

@@ -211,8 +211,7 @@ TEST(XmlOracleTest, WhatTheWriterWritesIsWellFormedAndHasTheSameTexts) {
       strings.push_back(PropertyList::string(text));
       texts.push_back(std::move(text));
     }
-    const auto written =
-        serializePropertyList(PropertyList::array(std::move(strings)), PropertyListFormat::xml);
+    const auto written = serializePropertyList(PropertyList::array(strings), PropertyListFormat::xml);
     ASSERT_TRUE(written);
     const Judgement judgement = judge(*written);
     ASSERT_TRUE(judgement.wellFormed) << *written;

@@ -124,7 +124,7 @@ bool readDate(std::string_view text, Node& node) noexcept {
   const int second = number(17, 2);
   if (!day.ok() || day.year() < std::chrono::year{1} || hour > 23 || minute > 59 || second > 59) return false;
   node.tag = Tag::date;
-  node.real = static_cast<double>(secondsSinceDayZero(day) + hour * 3600 + minute * 60 + second);
+  node.real = static_cast<double>(secondsSinceDayZero(day) + hour * 3600L + minute * 60L + second);
   return true;
 }
 
@@ -256,7 +256,7 @@ class Reader {
   PropertyList read();
 
  private:
-  static constexpr std::size_t kFirstBlock = 64 * 1024;
+  static constexpr std::size_t kFirstBlock = std::size_t{64} << 10;
   enum class Form { open, empty, wrong };
 
   std::size_t left() const noexcept { return static_cast<std::size_t>(end_ - cursor_); }
@@ -680,6 +680,7 @@ bool Reader::content() {
     }
     ++cursor_;
     const Element element = elementName();
+    if (element == Element::unknown) return false;
     const bool keyWanted =
         !frames_.empty() && frames_.back().isDictionary && (nodes_.size() - frames_.back().base) % 2 == 0;
     if (keyWanted != (element == Element::key)) return false;

@@ -145,7 +145,7 @@ class Writer {
   void scalar(const Node& node);
   void keyElement(const Node& node);
 
-  static constexpr std::size_t kBuffer = 32 * 1024;
+  static constexpr std::size_t kBuffer = std::size_t{32} << 10;
   // Room for an indented tag or two and a number between.
   static constexpr std::size_t kElementRoom = kDeepestPropertyList + 96;
   // Text is escaped in pieces, so that one check of the room does for a piece.
