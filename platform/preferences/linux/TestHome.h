@@ -23,9 +23,9 @@ namespace brenvik {
 // A home of its own for a test, removed with everything in it.
 class TestHome {
  public:
-  TestHome() {
-    char name[] = "/tmp/brenvik-preferences.XXXXXX";
-    root_ = ::mkdtemp(name);
+  explicit TestHome(std::string below = "/tmp") {
+    below += "/brenvik-preferences.XXXXXX";
+    root_ = ::mkdtemp(below.data());
     std::filesystem::create_directory(home());
   }
   TestHome(const TestHome&) = delete;
