@@ -187,10 +187,10 @@ TEST_F(ModemManagerLogsTest, OnAsksForDebugAndOffPutsInfoBack) {
   ASSERT_TRUE(manager.isUp());
   ModemManagerLogs logs(queues, bus.address());
   logs.setLogToFile(true);
-  EXPECT_LT(runQueue(), 1s);
+  runQueue();
   EXPECT_THAT(manager.calls(), ElementsAre("DEBUG"));
   logs.setLogToFile(false);
-  EXPECT_LT(runQueue(), 1s);
+  runQueue();
   EXPECT_THAT(manager.calls(), ElementsAre("DEBUG", "INFO"));
 }
 
@@ -225,9 +225,9 @@ TEST_F(ModemManagerLogsTest, ARefusalIsTakenAndTheNextSwitchAsksAgain) {
   StandinModemManager manager(bus.address(), Manners::refuses);
   ModemManagerLogs logs(queues, bus.address());
   logs.setLogToFile(true);
-  EXPECT_LT(runQueue(), 1s);
+  runQueue();
   logs.setLogToFile(true);
-  EXPECT_LT(runQueue(), 1s);
+  runQueue();
   EXPECT_THAT(manager.calls(), ElementsAre("DEBUG", "DEBUG"));
 }
 
