@@ -88,12 +88,13 @@ def receive(sock):
 
 class FakeHelper:
     """Listens at `path` until closed. `answer(request)` gives the reply: bytes, or (bytes, descriptors), or None for
-    none. `refusal` is the code that check-ins are refused with. Every request is kept in `requests`."""
+    none. `refusal` is the code that check-ins are refused with."""
 
     def __init__(self, path, answer=None, refusal=0):
         self.answer = answer or (lambda request: request.status(0))
         self.refusal = refusal
         self.requests = []
+        self.check_ins = []  # (request, reply), as bytes
         self.listening = socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET)
         self.listening.bind(str(path))
         self.listening.listen(8)
@@ -133,6 +134,7 @@ class FakeHelper:
         ours, theirs = socket.socketpair(socket.AF_UNIX, socket.SOCK_SEQPACKET)
         reply = (request._header(40, COMPLEX | 18) + struct.pack("<I", 1)
                  + struct.pack("<IIHBB", 0, 0, 0, 19, 0))
+        self.check_ins.append((request.data, reply))
         send(connection, (reply, [theirs.detach()]))
         threading.Thread(target=self._serve, args=(ours, request.fds[0]), daemon=True).start()
 
