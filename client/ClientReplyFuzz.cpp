@@ -9,14 +9,16 @@
 
 #include "client/Reply.h"
 
-// Replies of any bytes. The first byte chooses the routine, the second what comes with the datagram: low bits the
-// number of descriptors, then whether they are sealed memory or sockets, then whether the kernel cut something.
+// Replies of any bytes. The first byte chooses the routine, the second what comes with the datagram: low bits
+// the number of descriptors, then whether they are sealed memory or sockets, then whether the kernel cut
+// something.
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   using namespace brenvik;
   using namespace brenvik::client;
   if (size < 2) return 0;
   const std::size_t chosen = data[0] % (kRequestRoutines.size() + 1);
-  const RoutineFacts& routine = chosen == kRequestRoutines.size() ? kCheckInRoutine : kRequestRoutines[chosen];
+  const RoutineFacts& routine =
+      chosen == kRequestRoutines.size() ? kCheckInRoutine : kRequestRoutines[chosen];
   const std::uint8_t extras = data[1];
   const auto bytes = std::as_bytes(std::span(data + 2, std::min(size - 2, kBufferSize)));
 
@@ -24,8 +26,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   Incoming incoming;
   incoming.isCut = (extras & 8) != 0;
   for (unsigned i = 0; i < (extras & 3U); ++i) {
-    incoming.descriptors[i] = (extras & 4) != 0 ? UniqueFd(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0))
-                                                : makeSealedMemory(kContent);
+    incoming.descriptors[i] = (extras & 4) != 0
+                                  ? UniqueFd(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0))
+                                  : makeSealedMemory(kContent);
     ++incoming.descriptorCount;
   }
   Buffer buffer;

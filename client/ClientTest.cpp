@@ -60,8 +60,7 @@ UniqueFd connectTo(const std::string& path) {
   return socket;
 }
 
-// ---- check-in
-// -----------------------------------------------------------------------------------------------
+// ---- check-in ------------------------------------------------------------------------------------------
 
 TEST(ClientTest, ChecksInWithADeathWatchPortMovedToTheHelper) {
   Message seen;
@@ -202,8 +201,7 @@ TEST(ClientTest, AFullBacklogTimesOut) {
   EXPECT_EQ(bvmh_connect(client.get()), BVMH_ERROR_TIMED_OUT);
 }
 
-// ---- a helper that leaves, or is late
-// -----------------------------------------------------------------------
+// ---- a helper that leaves, or is late -------------------------------------------------------------------
 
 TEST(ClientTest, ChecksInAgainWhenTheHelperHadLeftBetweenTwoRequests) {
   ScriptedHelper helper([](Script& script) {
@@ -367,8 +365,7 @@ TEST(ClientTest, ReconnectLeavesTheOldChannelAndMakesANewOne) {
   EXPECT_EQ(BVMobileHelperClearVoicemailToken(client.get()), BVMH_ERROR_NOT_CONNECTED);
 }
 
-// ---- arguments
-// ----------------------------------------------------------------------------------------------
+// ---- arguments ------------------------------------------------------------------------------------------
 
 TEST(ClientTest, ArgumentsThatDoNotFitAreRefusedBeforeAnythingIsSent) {
   ScriptedHelper helper([](Script& script) {
@@ -451,8 +448,7 @@ TEST(ClientTest, TextsThatFillTheirFieldAreClosedByTheClient) {
   EXPECT_EQ(text, std::string(256, 'T'));
 }
 
-// ---- regions
-// ------------------------------------------------------------------------------------------------
+// ---- regions --------------------------------------------------------------------------------------------
 
 std::string contentOf(const UniqueFd& memory, std::size_t size) {
   std::string content(size, '\0');
@@ -592,8 +588,7 @@ TEST(ClientTest, ReturnedRegionsOutliveTheClient) {
   bvmh_region_free(nullptr);
 }
 
-// ---- a helper that lies
-// -------------------------------------------------------------------------------------
+// ---- a helper that lies ---------------------------------------------------------------------------------
 
 struct Lie {
   const char* name;
@@ -831,8 +826,7 @@ TEST(ClientTest, AChannelThatDoesNotBlockIsWaitedForAllTheSame) {
   EXPECT_EQ(BVMobileHelperClearVoicemailToken(client.get()), BVMH_ERROR_TIMED_OUT);
 }
 
-// ---- descriptors
-// --------------------------------------------------------------------------------------------
+// ---- descriptors ----------------------------------------------------------------------------------------
 
 std::size_t inheritableDescriptors() {
   std::size_t count = 0;

@@ -37,7 +37,7 @@ struct FreeClient {
 };
 using ClientPointer = std::unique_ptr<bvmh_client, FreeClient>;
 
-// ---- what the user sees -----------------------------------------------------------------------------------
+// ---- what the user sees ---------------------------------------------------------------------------------
 
 void printJson(const nlohmann::ordered_json& value) { std::printf("%s\n", jsonLine(value).c_str()); }
 
@@ -133,8 +133,7 @@ int report(const Settings& settings, bvmh_client* client, const Outcome& outcome
   return kDone;
 }
 
-// ---- running a command
-// --------------------------------------------------------------------------------------
+// ---- running a command ----------------------------------------------------------------------------------
 
 int watch(const Settings& settings, const Values& values) {
   EventStreamOptions options;
@@ -155,13 +154,10 @@ int run(const Settings& settings, const Command& command, const Values& values) 
   if (!settings.socket.empty() && bvmh_client_set_socket(client.get(), settings.socket.c_str()) != BVMH_OK) {
     return fail(settings, kUnusable, "--socket: the path is empty or too long for a socket");
   }
-  const std::int32_t code = bvmh_connect(client.get());
-  if (code != BVMH_OK) return reportCode(settings, client.get(), "BVMobileHelperCheckIn", code, "");
   return report(settings, client.get(), command.run(client.get(), values));
 }
 
-// ---- the parser, from the table
-// -----------------------------------------------------------------------------
+// ---- the parser, from the table -------------------------------------------------------------------------
 
 // A subcommand as the parser sees it; where its values land.
 struct Parsed {
@@ -248,7 +244,10 @@ int runCommandLine(int argc, const char* const* argv) {
       // Help and version come this way too.
       if (error.get_exit_code() == 0) return app.exit(error) == 0 ? kDone : kUnusable;
       settings.asJson = wantsJson();
-      return fail(settings, kUnusable, error.what(), "Run with --help for more.");
+      const std::vector<std::string> unknown = app.remaining(true);
+      const std::string message =
+          unknown.empty() ? error.what() : "not expected: " + printable(unknown.front());
+      return fail(settings, kUnusable, message, "Run with --help for more.");
     }
     for (Parsed& each : commands) {
       if (each.app->parsed()) return run(settings, *each.command, collect(each));

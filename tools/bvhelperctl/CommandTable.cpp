@@ -17,8 +17,7 @@
 namespace brenvik::tools {
 namespace {
 
-// ---- values
-// -------------------------------------------------------------------------------------------------
+// ---- values ---------------------------------------------------------------------------------------------
 
 template <class Number>
 std::optional<Number> numberIn(const std::string& text) {
@@ -74,8 +73,7 @@ std::string serialized(const PropertyList& value) {
   return *std::move(bytes);
 }
 
-// ---- outcomes
-// -----------------------------------------------------------------------------------------------
+// ---- outcomes -------------------------------------------------------------------------------------------
 
 Outcome did(const char* routine, std::int32_t code, std::string text) {
   Outcome outcome;
@@ -119,16 +117,17 @@ Outcome returnedText(const char* routine, std::int32_t code, const char* name, c
   return outcome;
 }
 
-// The name of the routine, said once for the call and for the outcome.
-#define BVHELPERCTL_CALL(routine, ...)                    \
-  [[maybe_unused]] constexpr const char* name = #routine; \
-  const std::int32_t code = routine(__VA_ARGS__)
+// Checks in and calls the routine, whose name is said once for the call and for the outcome. What was given
+// has been checked by then: wrong usage is told whether there is a helper or not.
+#define BVHELPERCTL_CALL(routine, ...)                 \
+  constexpr const char* name = #routine;               \
+  const std::int32_t connected = bvmh_connect(client); \
+  const std::int32_t code = connected != BVMH_OK ? connected : routine(__VA_ARGS__)
 
-// ---- commands
-// -----------------------------------------------------------------------------------------------
+// ---- commands -------------------------------------------------------------------------------------------
 
-Outcome ping(bvmh_client*, const Values&) {
-  return did("BVMobileHelperCheckIn", BVMH_OK, "the helper answers");
+Outcome ping(bvmh_client* client, const Values&) {
+  return did("BVMobileHelperCheckIn", bvmh_connect(client), "the helper answers");
 }
 
 Outcome setPreference(bvmh_client* client, const Values& values) {
@@ -353,8 +352,11 @@ Outcome askForLabels(const char* name, LabelsRoutine routine, bvmh_client* clien
   const std::string labelBytes = serialized(PropertyList::array(std::move(labels)));
   const std::string languageBytes = serialized(PropertyList::array(std::move(languages)));
   bvmh_region region{};
-  const std::int32_t code = routine(client, labelBytes.data(), labelBytes.size(), languageBytes.data(),
-                                    languageBytes.size(), &region);
+  const std::int32_t connected = bvmh_connect(client);
+  const std::int32_t code = connected != BVMH_OK
+                                ? connected
+                                : routine(client, labelBytes.data(), labelBytes.size(), languageBytes.data(),
+                                          languageBytes.size(), &region);
   Outcome outcome = did(name, code, "");
   if (code != BVMH_OK) return outcome;
   const PropertyList result = parsePropertyList({static_cast<const std::byte*>(region.bytes), region.size});
@@ -402,8 +404,7 @@ Outcome remapChannel(bvmh_client* client, const Values& values) {
   return triedTo(name, code, success, "moved " + what, "did not move " + what);
 }
 
-// ---- the table
-// ----------------------------------------------------------------------------------------------
+// ---- the table ------------------------------------------------------------------------------------------
 
 constexpr std::size_t kShort = 63;
 constexpr std::size_t kText = 255;

@@ -78,7 +78,7 @@ struct Command {
   std::vector<const char*> routines;
   std::vector<Parameter> positionals;
   std::vector<Parameter> options;
-  // Called with a client that has checked in. Throws UsageError, and std::bad_alloc.
+  // Called with a client that has not checked in yet. Throws UsageError, and std::bad_alloc.
   Outcome (*run)(bvmh_client* client, const Values& values);
   // True: needs no helper; run is called with null before anything is connected.
   bool isLocal = false;

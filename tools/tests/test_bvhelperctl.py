@@ -1,0 +1,470 @@
+#!/usr/bin/env python3
+# SPDX-License-Identifier: Apache-2.0
+# SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+"""bvhelperctl and brenvik-standin as a person or a script runs them, against a helper played by the test.
+
+usage: test_bvhelperctl.py [unittest arguments]; BRENVIK_BUILD names the build folder.
+"""
+import base64
+import json
+import os
+import pathlib
+import plistlib
+import signal
+import socket
+import struct
+import subprocess
+import tempfile
+import unittest
+
+import fake_helper
+from fake_helper import FakeHelper
+
+BUILD = pathlib.Path(os.environ["BRENVIK_BUILD"])
+ALLOW = "com.norvale.Teravox.BrenvikHelper.allow"
+XML = plistlib.dumps
+
+
+class ToolTest(unittest.TestCase):
+    def setUp(self):
+        folder = tempfile.TemporaryDirectory(prefix="bvhelperctl-")
+        self.addCleanup(folder.cleanup)
+        self.folder = pathlib.Path(folder.name)
+        self.socket = self.folder / "helper"
+
+    def helper(self, answer=None, refusal=0):
+        helper = FakeHelper(self.socket, answer, refusal)
+        self.addCleanup(helper.close)
+        return helper
+
+    def run_tool(self, *arguments, status=0, cwd=None):
+        """Runs bvhelperctl and returns what it printed on standard output and standard error."""
+        done = subprocess.run([BUILD / "bvhelperctl", "--socket", self.socket, *arguments], capture_output=True,
+                              text=True, timeout=60, cwd=cwd, stdin=subprocess.DEVNULL)
+        self.assertEqual(done.returncode, status, (arguments, done.stdout, done.stderr))
+        return done.stdout, done.stderr
+
+    def json(self, *arguments, status=0):
+        out, err = self.run_tool("--json", *arguments, status=status)
+        self.assertEqual(err, "")
+        self.assertEqual(out.count("\n"), 1)
+        return json.loads(out)
+
+    def asked(self, helper, *arguments, says=None, **more):
+        """The one request that a command makes."""
+        helper.requests.clear()
+        out, err = self.run_tool(*arguments, **more)
+        self.assertEqual(err, "")
+        if says is not None:
+            self.assertEqual(out, says + "\n")
+        self.assertEqual(len(helper.requests), 1)
+        return helper.requests[0]
+
+
+class Requests(ToolTest):
+    """What each command asks for, and says when it is done."""
+
+    def test_ping_checks_in_and_asks_for_nothing(self):
+        helper = self.helper()
+        self.assertEqual(self.run_tool("ping"), ("the helper answers\n", ""))
+        self.assertEqual(helper.requests, [])
+        self.assertEqual(self.json("ping"), {"ok": True, "routine": "BVMobileHelperCheckIn", "code": 0})
+
+    def test_preferences_are_set_with_every_type(self):
+        helper = self.helper()
+        plist = self.folder / "value.plist"
+        plist.write_bytes(XML({"a": [1, b"x"]}))
+        for arguments, value in [
+            (["text"], "text"), (["--type", "string", "K\u00f6ln"], "K\u00f6ln"), ([""], ""),
+            (["--type", "integer", "-12"], -12), (["--type", "integer", "18446744073709551615"], 2**64 - 1),
+            (["--type", "real", "-0.5"], -0.5), (["--type", "bool", "yes"], True), (["--type", "bool", "false"], False),
+            (["--type", "data", "Zm9v"], b"foo"), (["--", "--dashed"], "--dashed"), (["[x]"], "[x]"),
+        ]:
+            request = self.asked(helper, "prefs", "set", "com.norvale.carrier", "Key", *arguments,
+                                 says="set Key of com.norvale.carrier")
+            self.assertEqual(request.id, 8683555)
+            self.assertEqual(request.text(52, 256), "com.norvale.carrier")
+            self.assertEqual(request.text(308, 256), "Key")
+            self.assertEqual(plistlib.loads(request.region()), value)
+        request = self.asked(helper, "prefs", "set", "d", "k", "--type", "plist-file", str(plist))
+        self.assertEqual(request.region(), plist.read_bytes())
+
+    def test_a_large_value_arrives_whole(self):
+        helper = self.helper()
+        plist = self.folder / "value.plist"
+        plist.write_bytes(XML(["x" * 100_000]))
+        request = self.asked(helper, "prefs", "set", "d", "k", "--type", "plist-file", str(plist))
+        self.assertEqual(request.region(), plist.read_bytes())
+
+    def test_a_preference_is_deleted_by_a_value_of_one_byte(self):
+        helper = self.helper()
+        request = self.asked(helper, "prefs", "delete", "d", "k", says="removed k of d")
+        self.assertEqual(request.id, 8683555)
+        self.assertEqual(len(request.region()), 1)
+
+    def test_preferences_are_shown(self):
+        value = {"Name": "Norvale", "List": [1, 2.5, True], "Data": b"foo"}
+        helper = self.helper(lambda request: request.payload(XML(value, sort_keys=False)))
+        for words, message_id in [("get", 8683556), ("get-app", 8683557)]:
+            request = self.asked(helper, "prefs", words, "domain", "key",
+                                 says="Name: Norvale\nList:\n  - 1\n  - 2.5\n  - true\nData: <3 bytes: 66 6f 6f>")
+            self.assertEqual(request.id, message_id)
+            self.assertEqual((request.text(32, 256), request.text(288, 256)), ("domain", "key"))
+        self.assertEqual(self.json("prefs", "get", "d", "k"), {
+            "ok": True, "routine": "BVMobileHelperCopyPreferenceValue", "code": 0, "found": True,
+            "value": {"Name": "Norvale", "List": [1, 2.5, True],
+                      "Data": {"base64": base64.b64encode(b"foo").decode()}}})
+
+    def test_a_preference_that_is_not_there_is_no_failure(self):
+        helper = self.helper(lambda request: request.payload(b""))
+        self.asked(helper, "prefs", "get", "d", "k", says="(no value)")
+        answer = self.json("prefs", "get", "d", "k")
+        self.assertEqual((answer["ok"], answer["found"], answer["value"]), (True, False, None))
+
+    def test_a_value_in_sealed_memory_is_shown_too(self):
+        text = "x" * 200_000
+        helper = self.helper(lambda request: request.payload(XML(text), in_line=False))
+        self.asked(helper, "prefs", "get", "d", "k", says=text)
+
+    def test_a_property_list_file_is_named_by_its_absolute_path(self):
+        helper = self.helper(lambda request: request.payload(XML({"k": "v"})))
+        request = self.asked(helper, "plist", "load", "a.plist", says="k: v", cwd=self.folder)
+        self.assertEqual(request.id, 8683572)
+        self.assertEqual(request.text(32, 256), f"{self.folder}/a.plist")
+
+    def test_voicemail(self):
+        helper = self.helper()
+        request = self.asked(helper, "voicemail", "set-token", "T", says="set the voicemail token")
+        self.assertEqual((request.id, request.text(32, 256)), (8683549, "T"))
+        request = self.asked(helper, "voicemail", "set-token", "--key", "K", "T", says="set the voicemail token for K")
+        self.assertEqual((request.id, request.text(32, 256), request.text(288, 256)), (8683550, "K", "T"))
+        request = self.asked(helper, "voicemail", "clear", says="cleared the voicemail token")
+        self.assertEqual((request.id, len(request.data)), (8683551, 24))
+        request = self.asked(helper, "voicemail", "reset", says="cleared the voicemail token and removed every record")
+        self.assertEqual(request.id, 8683552)
+        helper.answer = lambda request: request.string("secret", 256)
+        request = self.asked(helper, "voicemail", "token", "--key", "K", says="secret")
+        self.assertEqual((request.id, request.text(32, 256)), (8683553, "K"))
+        request = self.asked(helper, "voicemail", "token", says="secret")
+        self.assertEqual(request.id, 8683554)
+        self.assertEqual(self.json("voicemail", "token")["token"], "secret")
+        helper.answer = lambda request: request.string("", 256)
+        self.asked(helper, "voicemail", "token", says="(no token)")
+        helper.answer = lambda request: request.boolean(1)
+        self.assertEqual(self.asked(helper, "voicemail", "subscribed", says="subscribed").id, 8683561)
+        helper.answer = lambda request: request.boolean(0)
+        self.asked(helper, "voicemail", "subscribed", says="not subscribed")
+        self.assertIs(self.json("voicemail", "subscribed")["subscribed"], False)
+
+    def test_carrier(self):
+        helper = self.helper()
+        request = self.asked(helper, "carrier", "replace-link", "rel/target", "/l", "--domain", "d",
+                             says="/l -> rel/target")
+        self.assertEqual(request.id, 8683558)
+        self.assertEqual([request.text(at, 1024) for at in (32, 1056, 2080)], ["rel/target", "/l", "d"])
+        request = self.asked(helper, "carrier", "create-link", "t", "l", cwd="/", says="/l -> t")
+        self.assertEqual((request.id, request.text(32, 1024), request.text(1056, 1024)), (8683559, "t", "/l"))
+        request = self.asked(helper, "carrier", "remove", "/f", says="removed /f")
+        self.assertEqual((request.id, request.text(32, 1024), request.text(1056, 1024)), (8683560, "/f", ""))
+        helper.answer = lambda request: request.boolean(1)
+        request = self.asked(helper, "carrier", "copy-file", "/s", "/d", "n", says="copied n from /s to /d")
+        self.assertEqual(request.id, 8683564)
+        self.assertEqual([request.text(at, 256) for at in (32, 288, 544)], ["/s", "/d", "n"])
+        request = self.asked(helper, "carrier", "copy-crash-logs", "/c", says="copied /c to the crash logs")
+        self.assertEqual((request.id, request.text(32, 256)), (8683565, "/c"))
+        request = self.asked(helper, "carrier", "move-bundle", "/s", "/d", "n", says="moved /s to /d/n")
+        self.assertEqual(request.id, 8683566)
+        self.assertEqual([request.text(at, 256) for at in (32, 288, 544)], ["/s", "/d", "n"])
+        request = self.asked(helper, "carrier", "unpack", "/a.zip", "/d", says="unpacked /a.zip into /d")
+        self.assertEqual((request.id, request.text(32, 256), request.text(288, 256)), (8683571, "/a.zip", "/d"))
+
+    def test_switches(self):
+        helper = self.helper()
+        for command, message_id, text in [("heartbeat", 8683562, "cellular heartbeat"),
+                                          ("radio-logs", 8683570, "radio manager logs")]:
+            for state, value in [("on", 1), ("off", 0)]:
+                request = self.asked(helper, command, state, says=f"{text} {state}")
+                self.assertEqual((request.id, request.integer()), (message_id, value))
+
+    def test_database_check(self):
+        helper = self.helper()
+        for arguments, mask in [([], 31), (["--type", "gsm"], 8), (["--type", "lte", "--type", "umts"], 5),
+                                (["--mask", "-1"], -1), (["--mask", "0"], 0)]:
+            request = self.asked(helper, "lasd", "check", *arguments)
+            self.assertEqual((request.id, request.integer()), (8683563, mask))
+        self.assertEqual(self.json("lasd", "check", "--type", "cdma")["mask"], 2)
+
+    def test_location(self):
+        helper = self.helper()
+        request = self.asked(helper, "location", "civic", "-33.5", "151.25")
+        self.assertEqual((request.id, request.double(32), request.double(40)), (8683567, -33.5, 151.25))
+        self.assertEqual(self.asked(helper, "location", "wan-ip").id, 8683569)
+        helper.answer = lambda request: request.string("DE", 64)
+        self.assertEqual(self.asked(helper, "location", "country", says="DE").id, 8683568)
+        self.assertEqual(self.json("location", "country")["country"], "DE")
+        helper.answer = lambda request: request.string("", 64)
+        self.asked(helper, "location", "country", says="(not known)")
+
+    def test_labels_are_asked_for_in_the_order_given(self):
+        helper = self.helper(lambda request: request.payload(XML(["G", "M"])))
+        request = self.asked(helper, "labels", "badges", "--text", "My line", "--label", "cell-data", "--language", "de",
+                             "--text", "Other", "--language", "en", says="G\nM")
+        self.assertEqual(request.id, 8683573)
+        self.assertEqual(plistlib.loads(request.region(28)), ["", "My line", "USER_LABEL_CELL_DATA", "", "", "Other"])
+        self.assertEqual(plistlib.loads(request.region(44)), ["de", "en"])
+        request = self.asked(helper, "labels", "localized", "--label", "business", "--label", "USER_LABEL_own",
+                             says="G\nM")
+        self.assertEqual(request.id, 8683574)
+        self.assertEqual(plistlib.loads(request.region(28)), ["USER_LABEL_BUSINESS", "USER_LABEL_own"])
+        self.assertEqual(plistlib.loads(request.region(44)), [])
+        self.assertEqual(self.json("labels", "localized", "--label", "travel")["labels"], ["G", "M"])
+
+    def test_contacts(self):
+        helper = self.helper(lambda request: request.boolean(1))
+        request = self.asked(helper, "contacts", "remap", "old", "new", says="moved contacts from old to new")
+        self.assertEqual((request.id, request.text(32, 64), request.text(96, 64)), (8683575, "old", "new"))
+
+
+class Refusals(ToolTest):
+    """Exit status 1: the helper was there and said no."""
+
+    def test_a_caller_without_the_entitlement_is_told_what_to_do(self):
+        self.helper(refusal=35)
+        out, err = self.run_tool("ping", status=1)
+        self.assertEqual(out, "")
+        lines = err.splitlines()
+        self.assertEqual(lines[0], f"bvhelperctl: refused: the caller lacks the entitlement {ALLOW}")
+        self.assertIn("/etc/brenvik/entitlements.d/bvhelperctl.plist", lines[1])
+        # What it says is a good entitlement file for this very program.
+        advice = plistlib.loads("\n".join(line.strip() for line in lines[2:]).encode())
+        self.assertEqual(advice["Executable"], str((BUILD / "bvhelperctl").resolve()))
+        self.assertEqual(advice["Entitlements"], {ALLOW: True})
+        self.assertIn("User", advice)
+        answer = self.json("heartbeat", "on", status=1)
+        self.assertEqual(answer, {"ok": False, "routine": "BVMobileHelperCellularHeartbeat", "code": 35,
+                                  "error": f"refused: the caller lacks the entitlement {ALLOW}"})
+
+    def test_codes_are_explained(self):
+        for arguments, code, message in [
+            (["prefs", "set", "d", "k", "v"], 5, "the helper could not do it (code 5)"),
+            (["plist", "load", "/x"], 9, "/x is missing, not readable for the helper, or no property list with a "
+                                         "dictionary on top (code 9)"),
+            (["carrier", "replace-link", "t", "/l"], 8,
+             "refused: /l is not one of the carrier links and files that may be replaced, or is a folder"),
+            (["carrier", "remove", "/f"], 8, "refused: /f is no carrier file: not listed, not in the carrier bundles, "
+                                             "no package in /tmp"),
+            (["carrier", "create-link", "t", "/l"], 5, "the helper could not do it (code 5)"),
+            (["radio-logs", "on"], 46, "not supported by this build of the helper (code 46)"),
+            (["heartbeat", "on"], -304, "the helper found the request malformed (code -304)"),
+            (["location", "country"], 4711, "the helper answered with a code of its system (code 4711)"),
+        ]:
+            with self.subTest(arguments=arguments), FakeHelper(self.socket, lambda request: request.status(code)):
+                out, err = self.run_tool(*arguments, status=1)
+                self.assertEqual((out, err), ("", f"bvhelperctl: {message}\n"))
+                answer = self.json(*arguments, status=1)
+                self.assertEqual((answer["ok"], answer["code"], answer["error"]), (False, code, message))
+            self.socket.unlink()
+
+    def test_work_that_failed_is_a_failure(self):
+        self.helper(lambda request: request.boolean(0))
+        for arguments, what in [
+            (["carrier", "copy-file", "/s", "/d", "n"], "did not copy n from /s to /d"),
+            (["carrier", "copy-crash-logs", "/c"], "did not copy /c"),
+            (["carrier", "move-bundle", "/s", "/d", "n"], "did not move /s to /d/n"),
+            (["carrier", "unpack", "/a", "/d"], "did not unpack /a into /d"),
+            (["contacts", "remap", "a", "b"], "did not move contacts from a to b"),
+        ]:
+            out, err = self.run_tool(*arguments, status=1)
+            self.assertEqual((out, err), ("", f"bvhelperctl: {what}; the helper's log tells why\n"))
+            self.assertEqual(self.json(*arguments, status=1)["code"], 0)
+
+    def test_a_value_that_is_no_property_list_is_a_failure(self):
+        self.helper(lambda request: request.payload(b"\x1b[31m"))
+        _, err = self.run_tool("prefs", "get", "d", "k", status=1)
+        self.assertEqual(err, "bvhelperctl: the helper returned something that is no property list\n")
+        self.run_tool("labels", "badges", "--label", "travel", status=1)
+
+    def test_nothing_that_the_helper_sends_steers_the_terminal(self):
+        self.helper(lambda request: request.string("\x1b]0;x\x07", 256))
+        out, _ = self.run_tool("voicemail", "token")
+        self.assertEqual(out, "\\x1b]0;x\\x07\n")
+
+
+class Unusable(ToolTest):
+    """Exit status 2: wrong usage, or no helper."""
+
+    def test_no_helper(self):
+        out, err = self.run_tool("ping", status=2)
+        self.assertEqual(out, "")
+        self.assertEqual(err.splitlines()[0],
+                         f"bvhelperctl: cannot reach the helper at {self.socket}: No such file or directory")
+        answer = self.json("ping", status=2)
+        self.assertEqual((answer["ok"], answer["code"]), (False, -7004))
+
+    def test_a_socket_that_nobody_serves(self):
+        with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as dead:
+            dead.bind(str(self.socket))
+        _, err = self.run_tool("ping", status=2)
+        self.assertIn("Connection refused", err)
+
+    def test_a_helper_that_does_not_answer(self):
+        self.helper(lambda request: None)
+        _, err = self.run_tool("--timeout", "0.05", "location", "country", status=2)
+        self.assertEqual(err.splitlines()[0], "bvhelperctl: no answer in 0.05 s")
+
+    def test_a_helper_that_lies(self):
+        self.helper(lambda request: request.status(0)[:-1])
+        _, err = self.run_tool("location", "country", status=2)
+        self.assertEqual(err, "bvhelperctl: the answer breaks the protocol\n")
+
+    def test_wrong_usage_is_told_without_a_helper(self):
+        (self.folder / "no.plist").write_text("no property list")
+        for arguments, message in [
+            ([], "A subcommand is required"),
+            (["frobnicate"], "not expected: frobnicate"),
+            (["prefs"], "A subcommand is required"),
+            (["ping", "pong"], "not expected: pong"),
+            (["--frob", "ping"], "not expected: --frob"),
+            (["prefs", "get", "d"], "KEY is required"),
+            (["prefs", "set", "d", "k", "x", "--type", "integer"], '"x" is not an integer of 64 bits'),
+            (["prefs", "set", "d", "k", "", "--type", "real"], '"" is not a number'),
+            (["prefs", "set", "d", "k", "on", "--type", "bool"], '"on" is not true or false'),
+            (["prefs", "set", "d", "k", "%", "--type", "data"], '"%" is not base64'),
+            (["prefs", "set", "d", "k", "v", "--type", "date"],
+             '--type: "date" is not one of: string, integer, real, bool, data, plist-file'),
+            (["prefs", "set", "d", "k", "--type", "plist-file", f"{self.folder}/none"],
+             f"cannot read {self.folder}/none"),
+            (["prefs", "set", "d", "k", "--type", "plist-file", f"{self.folder}/no.plist"],
+             f"{self.folder}/no.plist is not a property list"),
+            (["prefs", "get", "d", "k" * 256], "KEY: at most 255 bytes"),
+            (["contacts", "remap", "f" * 64, "t"], "FROM: at most 63 bytes"),
+            (["heartbeat", "maybe"], 'STATE: "maybe" is not one of: on, off'),
+            (["lasd", "check", "--type", "5g"], '--type: "5g" is not one of: gsm, umts, cdma, lte, scdma'),
+            (["lasd", "check", "--mask", "x"], '--mask: "x" is not an integer of 32 bits'),
+            (["lasd", "check", "--mask", "1", "--type", "gsm"],
+             "--mask and --type say the same: give one of them"),
+            (["location", "civic", "91", "0"], 'LATITUDE: "91" is not a latitude, -90 to 90'),
+            (["labels", "badges"], "no label given"),
+            (["watch", "--count", "0"], '--count: "0" is not a number from 1 on'),
+        ]:
+            with self.subTest(arguments=arguments):
+                out, err = self.run_tool(*arguments, status=2)
+                self.assertEqual((out, err.splitlines()[0]), ("", f"bvhelperctl: {message}"))
+                self.assertEqual(self.json(*arguments, status=2), {"ok": False, "error": message})
+
+    def test_help_and_version_are_no_failures(self):
+        for arguments in (["--help"], ["prefs", "--help"], ["prefs", "set", "--help"], ["--version"]):
+            out, err = self.run_tool(*arguments)
+            self.assertNotEqual(out, "")
+            self.assertEqual(err, "")
+
+    def test_a_socket_path_that_is_too_long(self):
+        self.socket = self.folder / ("x" * 120)
+        _, err = self.run_tool("ping", status=2)
+        self.assertEqual(err, "bvhelperctl: --socket: the path is empty or too long for a socket\n")
+
+
+def push(message_id, values, reply_port=7):
+    data = plistlib.dumps(values, fmt=plistlib.FMT_BINARY, sort_keys=False)
+    return (struct.pack("<IIIIIi", 0x80000012, 52, reply_port, 0, 0, message_id) + struct.pack("<I", 1)
+            + struct.pack("<QBBBBI", 56, 0, 1, 0, 1, len(data)) + fake_helper.NDR + bytes(4) + data)  # 52, rounded up to 56
+
+
+def notification(values):
+    return struct.pack("<IIIIIi", 0, 24, 0, 0, 0, 0) + plistlib.dumps(values, fmt=plistlib.FMT_BINARY, sort_keys=False)
+
+
+CIVIC = {"Client": ["BrenvikMobileHelper"], "CountryCode": "DE", "State": "", "City": "K\u00f6ln", "PostalCode": "50667"}
+UPDATE = {"Notification": "com.norvale.lasd.UpdateAvailable", "DBType": "gsm"}
+
+
+class Events(ToolTest):
+    """watch and brenvik-standin, with a helper played by the test."""
+
+    def start(self, *command):
+        program = subprocess.Popen([BUILD / command[0], *command[1:], "--directory", self.folder],
+                                   stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
+        self.addCleanup(program.stdout.close)
+        self.addCleanup(program.stderr.close)
+        self.addCleanup(program.wait)
+        self.addCleanup(program.kill)
+        self.assertEqual(program.stderr.readline(), f"{command[0]}: listening in {self.folder}\n")
+        return program
+
+    def send(self, service, message):
+        sock = socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET)
+        self.addCleanup(sock.close)
+        sock.settimeout(10)
+        sock.connect(str(self.folder / service))
+        sock.send(message)
+        return sock
+
+    def test_both_show_and_answer(self):
+        for command in (["bvhelperctl", "watch", "--count", "3"], ["brenvik-standin", "--count", "3"]):
+            program = self.start(*command)
+            reply = self.send("com.norvale.brenvik", push(9100001, CIVIC)).recv(100)
+            self.assertEqual(reply, struct.pack("<IIIIIi", 18, 44, 0, 7, 0, 9100101) + fake_helper.NDR
+                             + struct.pack("<iq", 0, 0))
+            self.assertEqual(program.stdout.readline(),
+                             'civic-info Client=BrenvikMobileHelper CountryCode="DE" State="" City="K\u00f6ln" '
+                             'PostalCode="50667" (answer: success)\n')
+            self.send("com.norvale.brenvik", push(9100002, {"Client": [], "Address": "192.0.2.7"}))
+            self.assertIn('local-address Client= Address="192.0.2.7"', program.stdout.readline())
+            self.send("com.norvale.Brenvik.lasd", notification(UPDATE)).close()
+            self.assertEqual(program.stdout.readline(),
+                             'notification Notification="com.norvale.lasd.UpdateAvailable" DBType="gsm"\n')
+            self.assertEqual(program.wait(10), 0)
+            self.assertEqual(list(self.folder.iterdir()), [])
+
+    def test_json_lines(self):
+        for command in (["bvhelperctl", "watch"], ["brenvik-standin"]):
+            program = self.start(*command, "--json", "--count", "2")
+            self.send("com.norvale.brenvik", push(9100001, CIVIC)).recv(100)
+            line = json.loads(program.stdout.readline())
+            self.assertEqual(line, {"event": "civic-info", "values": CIVIC, "answer": "success",
+                                    "sender": {"uid": os.getuid(), "pid": os.getpid()}})
+            self.send("com.norvale.Brenvik.lasd", notification(UPDATE))
+            line = json.loads(program.stdout.readline())
+            self.assertEqual((line["event"], line["values"], line["answer"]), ("notification", UPDATE, "none"))
+            self.assertEqual(program.wait(10), 0)
+
+    def test_the_stand_in_refuses(self):
+        program = self.start("brenvik-standin", "--refuse", "13", "--count", "1")
+        reply = self.send("com.norvale.brenvik", push(9100001, CIVIC)).recv(100)
+        self.assertEqual(struct.unpack_from("<iII", reply, 32), (13, 0, 13))
+        self.assertIn("(answer: refused with 13)", program.stdout.readline())
+        self.assertEqual(program.wait(10), 0)
+
+    def test_the_stand_in_hangs(self):
+        program = self.start("brenvik-standin", "--hang")
+        sock = self.send("com.norvale.brenvik", push(9100001, CIVIC))
+        self.assertIn("(answer: none)", program.stdout.readline())
+        sock.setblocking(False)
+        with self.assertRaises(BlockingIOError):
+            sock.recv(100)
+        program.send_signal(signal.SIGINT)
+        self.assertEqual(program.wait(10), 0)
+
+    def test_signals_end_it_cleanly(self):
+        for number in (signal.SIGINT, signal.SIGTERM):
+            program = self.start("bvhelperctl", "watch")
+            program.send_signal(number)
+            self.assertEqual(program.wait(10), 0)
+            self.assertEqual(list(self.folder.iterdir()), [])
+
+    def test_only_one_listens(self):
+        self.start("brenvik-standin")
+        done = subprocess.run([BUILD / "bvhelperctl", "watch", "--directory", self.folder], capture_output=True,
+                              text=True, timeout=60)
+        self.assertEqual(done.returncode, 2)
+        self.assertEqual(done.stderr,
+                         f"bvhelperctl: cannot listen in {self.folder}: another process serves that name\n")
+
+    def test_wrong_usage_of_the_stand_in(self):
+        for arguments in (["--refuse", "0"], ["--refuse", "x"], ["--refuse", "1", "--hang"], ["--count", "0"], ["x"]):
+            done = subprocess.run([BUILD / "brenvik-standin", *arguments], capture_output=True, timeout=60)
+            self.assertEqual(done.returncode, 2, arguments)
+
+
+if __name__ == "__main__":
+    unittest.main()

@@ -1,0 +1,95 @@
+#!/usr/bin/env python3
+# SPDX-License-Identifier: Apache-2.0
+# SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+"""The installed C library, used as other projects use it: pkg-config, CMake, shared and static, from C and C++.
+
+BRENVIK_BUILD names the build folder, BRENVIK_SOURCE the project's.
+"""
+import os
+import pathlib
+import re
+import subprocess
+import tempfile
+import unittest
+
+from fake_helper import FakeHelper
+
+BUILD = pathlib.Path(os.environ["BRENVIK_BUILD"])
+SOURCE = pathlib.Path(os.environ["BRENVIK_SOURCE"])
+CONSUMER = SOURCE / "client" / "consumer"
+STRICT = ["-Wall", "-Wextra", "-Wpedantic", "-Werror"]
+
+
+def run(*command, **more):
+    return subprocess.run([str(each) for each in command], check=True, capture_output=True, text=True, timeout=300,
+                          **more).stdout
+
+
+class InstalledClient(unittest.TestCase):
+    @classmethod
+    def setUpClass(cls):
+        folder = tempfile.TemporaryDirectory(prefix="client-install-")
+        cls.addClassCleanup(folder.cleanup)
+        cls.folder = pathlib.Path(folder.name)
+        cls.prefix = cls.folder / "prefix"
+        for component in ("client", "client-dev"):
+            run("cmake", "--install", BUILD, "--component", component, "--prefix", cls.prefix)
+        cls.library = next(cls.prefix.rglob("libbrenvik-mobile-helper.so.0"))
+
+    def config(self, *arguments):
+        environment = {**os.environ, "PKG_CONFIG_PATH": str(self.library.parent / "pkgconfig")}
+        return run("pkg-config", *arguments, "brenvik-mobile-helper", env=environment).split()
+
+    def expect_working(self, program):
+        path = self.folder / "helper"
+        environment = {**os.environ, "LD_LIBRARY_PATH": str(self.library.parent)}
+        with FakeHelper(path, lambda request: request.string("DE", 64)):
+            self.assertEqual(run(program, path, env=environment), "DE\n")
+        path.unlink()
+        failed = subprocess.run([program, path], env=environment, capture_output=True, text=True, timeout=60)
+        self.assertEqual((failed.returncode, failed.stderr), (1, "no helper answers at its socket\n"))
+
+    def test_shared_through_pkg_config_from_c(self):
+        program = self.folder / "c-shared"
+        run("cc", "-std=c11", *STRICT, CONSUMER / "main.c", "-o", program, *self.config("--cflags", "--libs"))
+        self.expect_working(program)
+        self.assertIn("libbrenvik-mobile-helper.so.0", run("objdump", "-p", program))
+
+    def test_static_through_pkg_config_from_c(self):
+        program = self.folder / "c-static"
+        libraries = [each if each != "-lbrenvik-mobile-helper" else "-l:libbrenvik-mobile-helper.a"
+                     for each in self.config("--static", "--libs")]
+        run("cc", "-std=c11", *STRICT, CONSUMER / "main.c", "-o", program, *self.config("--cflags"), *libraries)
+        self.expect_working(program)
+        self.assertNotIn("libbrenvik-mobile-helper", run("objdump", "-p", program))
+
+    def test_from_cpp(self):
+        program = self.folder / "cpp"
+        run("c++", "-std=c++20", *STRICT, "-x", "c++", CONSUMER / "main.c", "-x", "none", "-o", program,
+            *self.config("--cflags", "--libs"))
+        self.expect_working(program)
+
+    def test_through_cmake(self):
+        build = self.folder / "consumer"
+        run("cmake", "-S", CONSUMER, "-B", build, f"-DCMAKE_PREFIX_PATH={self.prefix}")
+        run("cmake", "--build", build)
+        for program in ("shared", "static"):
+            self.expect_working(build / program)
+
+    def test_the_shared_library_exports_what_the_header_declares(self):
+        header = (self.prefix / "include" / "brenvik" / "mobile_helper.h").read_text()
+        declared = set(re.findall(r"\b(bvmh_\w+|BVMobileHelper\w+)\(", re.sub(r"/\*.*?\*/", "", header, flags=re.S)))
+        symbols = [line.split() for line in run("nm", "-D", "--defined-only", self.library).splitlines()]
+        exported = {name.split("@")[0] for _, kind, name in symbols if kind == "T"}
+        self.assertEqual(exported, declared)
+        self.assertEqual({name for _, kind, name in symbols if kind not in "TA"}, set())
+        self.assertEqual(len({name for name in exported if name.startswith("BVMobileHelper")}), 27)
+        self.assertIn("libbrenvik-mobile-helper.so.0", re.search(r"SONAME +(\S+)", run("objdump", "-p", self.library))[1])
+
+    def test_the_shared_library_needs_the_c_and_cpp_libraries_only(self):
+        needed = set(re.findall(r"NEEDED +(\S+)", run("objdump", "-p", self.library)))
+        self.assertLessEqual(needed, {"libc.so.6", "libstdc++.so.6", "libgcc_s.so.1"})
+
+
+if __name__ == "__main__":
+    unittest.main()
