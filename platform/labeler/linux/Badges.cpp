@@ -178,8 +178,8 @@ std::string_view windowOf(std::string_view label) noexcept {
 }
 
 // The capitals of a label that starts plainly: its first visible characters, as many as a badge has, are
-// ASCII and nothing else can have a say in them. Nothing for all others. A shortcut and no more: it halves
-// the time of a badge in most languages written in Latin letters.
+// ASCII and nothing else can have a say in them. Nothing for all others. A shortcut and no more, for
+// most of what is written in Latin letters.
 std::optional<std::string> plainCapitals(std::string_view label, std::string_view language) {
   if (language == "tr" || language == "az") return std::nullopt;  // their i is not plain
   std::string capitals;
