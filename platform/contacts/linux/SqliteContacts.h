@@ -23,8 +23,8 @@ class SqliteContacts final : public ContactsService {
   // trigger that never ends, and a database's owner is less trusted than this process.
   static constexpr std::chrono::milliseconds kLongestRemap{20000};
 
-  // `home` gives the account's home directory each time a manager is made; empty: there is none. It may throw
-  // nothing.
+  // `home` gives the account's home directory each time a manager is made; empty: there is none. Of
+  // exceptions it may throw std::bad_alloc.
   explicit SqliteContacts(std::function<std::string()> home, std::chrono::milliseconds patience = kPatience,
                           std::chrono::milliseconds longestRemap = kLongestRemap)
       : home_(std::move(home)), patience_(patience), longestRemap_(longestRemap) {}

@@ -177,10 +177,26 @@ std::string_view windowOf(std::string_view label) noexcept {
   return label.substr(0, clusters.offset());
 }
 
+// The capitals of a label that starts plainly: its first visible characters, as many as a badge has, are
+// ASCII and nothing else can have a say in them. Nothing for all others. A shortcut and no more, for
+// most of what is written in Latin letters.
+std::optional<std::string> plainCapitals(std::string_view label, std::string_view language) {
+  if (language == "tr" || language == "az") return std::nullopt;  // their i is not plain
+  std::string capitals;
+  for (const char c : label) {
+    const auto byte = static_cast<unsigned char>(c);
+    if (byte >= 0x80) return std::nullopt;  // of its own, or a mark on the character before
+    if (capitals.size() == kLongestBadge) return capitals;
+    if (isVisible(byte)) capitals += c >= 'a' && c <= 'z' ? static_cast<char>(c - 'a' + 'A') : c;
+  }
+  return capitals;
+}
+
 }  // namespace
 
 std::optional<std::string> Badges::make(std::string_view label) {
-  const std::string upper = upperCased(windowOf(label), language_);
+  const std::optional<std::string> plain = plainCapitals(label, language_);
+  const std::string upper = plain ? *plain : upperCased(windowOf(label), language_);
   std::string badge;
   std::string first;
   Clusters clusters(upper);

@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/labeler/linux/CatalogueLabeler.h"
 
+#include <array>
 #include <new>
 #include <optional>
 #include <utility>
@@ -30,19 +31,17 @@ LabelCatalogue catalogueFor(const PropertyList& languages) noexcept {
   return {};
 }
 
-// A label's name in the language; a user's own text stays as it is.
-std::string_view nameOf(std::string_view label, const LabelCatalogue& catalogue) noexcept {
+// The predefined label that an identifier stands for; nothing for a user's own text.
+std::optional<Label> labelOf(std::string_view text) noexcept {
   for (const auto& [identifier, predefined] : kIdentifiers) {
-    if (label == identifier) return catalogue.text(predefined);
+    if (text == identifier) return predefined;
   }
-  return label;
+  return std::nullopt;
 }
 
-// Calls `make` with each label's name and gathers the texts it returns; no value as soon as it returns
-// nothing.
+// Calls `make` with each label that is a text and gathers what it returns; no value as soon as that is none.
 template <class Make>
-PropertyList textsFor(const PropertyList& labels, const LabelCatalogue& catalogue,
-                      const Make& make) noexcept {
+PropertyList textsFor(const PropertyList& labels, const Make& make) noexcept {
   try {
     std::vector<PropertyList> texts;
     texts.reserve(labels.size());
@@ -50,7 +49,7 @@ PropertyList textsFor(const PropertyList& labels, const LabelCatalogue& catalogu
       const PropertyList label = labels.at(i);
       const std::optional<std::string_view> text = label.asString();
       if (!text.has_value()) continue;
-      PropertyList made = make(nameOf(*text, catalogue));
+      PropertyList made = make(label, *text);
       if (!made.hasValue()) return {};
       texts.push_back(std::move(made));
     }
@@ -66,16 +65,24 @@ PropertyList CatalogueLabeler::localizedBadgeLabels(const PropertyList& labels,
                                                     const PropertyList& languages) noexcept {
   const LabelCatalogue catalogue = catalogueFor(languages);
   Badges badges(catalogue.language());
-  return textsFor(labels, catalogue, [&badges](std::string_view name) {
-    const std::optional<std::string> badge = badges.make(name);
+  return textsFor(labels, [&](const PropertyList&, std::string_view text) {
+    const std::optional<Label> predefined = labelOf(text);
+    const std::optional<std::string> badge = badges.make(predefined ? catalogue.text(*predefined) : text);
     return badge.has_value() ? PropertyList::string(*badge) : PropertyList();
   });
 }
 
 PropertyList CatalogueLabeler::localizedLabels(const PropertyList& labels,
                                                const PropertyList& languages) noexcept {
-  return textsFor(labels, catalogueFor(languages),
-                  [](std::string_view name) { return PropertyList::string(name); });
+  const LabelCatalogue catalogue = catalogueFor(languages);
+  std::array<PropertyList, kLabelCount> names;  // one value for all labels alike, however many a client sends
+  return textsFor(labels, [&](const PropertyList& label, std::string_view text) {
+    const std::optional<Label> predefined = labelOf(text);
+    if (!predefined) return label;
+    PropertyList& name = names[static_cast<std::size_t>(*predefined)];
+    if (!name.hasValue()) name = PropertyList::string(catalogue.text(*predefined));
+    return name;
+  });
 }
 
 }  // namespace brenvik
