@@ -12,6 +12,7 @@
 #include <memory>
 #include <set>
 #include <sstream>
+#include <utility>
 
 #include "platform/net/linux/Routes.h"
 
@@ -77,14 +78,15 @@ bool isCellularInterface(std::string_view name, const CellularRuleFiles& files) 
   return true;  // out of memory: on the safe side
 }
 
-std::string interfaceWithoutCellular(const sockaddr& peer, const CellularRuleFiles& files) noexcept try {
+ConnectionWay wayTowards(const sockaddr& peer, const CellularRuleFiles& files) noexcept try {
   const auto index = interfaceTowards(peer);
   if (!index) return {};
   std::string name = nameOfInterface(*index);
-  if (name.empty() || isCellularInterface(name, files)) return {};
-  return name;
+  if (name.empty()) return {};
+  if (isCellularInterface(name, files)) return {ConnectionWay::Kind::cellular, {}};
+  return {ConnectionWay::Kind::open, std::move(name)};
 } catch (...) {
-  return {};
+  return {};  // out of memory
 }
 
 bool mayLookUpName(std::string_view host, const CellularRuleFiles& files) noexcept try {

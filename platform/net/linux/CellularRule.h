@@ -19,10 +19,14 @@ struct CellularRuleFiles {
 // True for an interface whose packets cost: named pdp_ip*, or of the kernel's device type "wwan".
 bool isCellularInterface(std::string_view name, const CellularRuleFiles& files = {}) noexcept;
 
-// The name of the interface that a connection to `peer` would use, when that is not a cellular one. Empty
-// when it is, when there is no route, and when that cannot be told. A socket bound to that interface
-// (SO_BINDTODEVICE) cannot stray to another when routes change.
-std::string interfaceWithoutCellular(const sockaddr& peer, const CellularRuleFiles& files = {}) noexcept;
+// How a connection to a peer would go.
+struct ConnectionWay {
+  enum class Kind { open, cellular, none };  // none: no route, or it cannot be told
+  Kind kind = Kind::none;
+  // With `open`, the interface. A socket bound to it (SO_BINDTODEVICE) cannot stray when routes change.
+  std::string interfaceName;
+};
+ConnectionWay wayTowards(const sockaddr& peer, const CellularRuleFiles& files = {}) noexcept;
 
 // Whether looking up the name may be tried without a packet leaving by a cellular interface: some route that
 // leads further than the link is not cellular, or there is none at all; and every name server stands on a way

@@ -58,11 +58,19 @@ class CellularRuleTest : public testing::Test {
     ASSERT_TRUE(network.ip("link set " + name + " up"));
     ASSERT_TRUE(network.ip("link set far" + n + " up"));
   }
-  std::string chosenFor(const char* address) {
-    std::string name;
-    const auto storage = addressOf(address);
-    network.run([&] { name = interfaceWithoutCellular(reinterpret_cast<const sockaddr&>(storage), files); });
-    return name;
+  // The interface, or "cellular" or "none".
+  std::string chosenFor(const sockaddr_storage& storage) {
+    ConnectionWay way;
+    network.run([&] { way = wayTowards(reinterpret_cast<const sockaddr&>(storage), files); });
+    if (way.kind == ConnectionWay::Kind::open) return way.interfaceName;
+    EXPECT_EQ(way.interfaceName, "");
+    return way.kind == ConnectionWay::Kind::cellular ? "cellular" : "none";
+  }
+  std::string chosenFor(const char* address) { return chosenFor(addressOf(address)); }
+  unsigned indexOf(const char* name) {
+    unsigned index = 0;
+    network.run([&] { index = ::if_nametoindex(name); });
+    return index;
   }
   bool mayLookUp(const char* host) {
     bool may = false;
@@ -91,12 +99,12 @@ TEST_F(CellularRuleTest, TheInterfaceOfTheRouteIsChosenAndACellularOneIsNot) {
   addInterface("pdp_ip0", 2);
   ASSERT_TRUE(network.ip("route add default via 10.0.2.2"));
   EXPECT_EQ(chosenFor("10.0.1.7"), "wifi0");
-  EXPECT_EQ(chosenFor("10.0.2.7"), "");
-  EXPECT_EQ(chosenFor("203.0.113.9"), "") << "the default route is cellular";
+  EXPECT_EQ(chosenFor("10.0.2.7"), "cellular");
+  EXPECT_EQ(chosenFor("203.0.113.9"), "cellular") << "the default route is cellular";
   EXPECT_EQ(chosenFor("127.0.0.1"), "lo");
   EXPECT_EQ(chosenFor("10.0.2.1"), "lo") << "our own address never leaves the machine";
   EXPECT_EQ(chosenFor("::ffff:10.0.1.7"), "wifi0");
-  EXPECT_EQ(chosenFor("::ffff:10.0.2.7"), "");
+  EXPECT_EQ(chosenFor("::ffff:10.0.2.7"), "cellular");
 }
 
 TEST_F(CellularRuleTest, RoutesOfIpVersion6AreAskedForTooAndAScopeNamesTheInterface) {
@@ -105,21 +113,17 @@ TEST_F(CellularRuleTest, RoutesOfIpVersion6AreAskedForTooAndAScopeNamesTheInterf
   ASSERT_TRUE(network.ip("-6 address add 2001:db8:1::1/64 dev wifi0 nodad"));
   ASSERT_TRUE(network.ip("-6 address add 2001:db8:2::1/64 dev pdp_ip0 nodad"));
   EXPECT_EQ(chosenFor("2001:db8:1::2"), "wifi0");
-  EXPECT_EQ(chosenFor("2001:db8:2::2"), "");
+  EXPECT_EQ(chosenFor("2001:db8:2::2"), "cellular");
   EXPECT_EQ(chosenFor("::1"), "lo");
-  network.run([&] {
-    const auto wifi = addressOf("fe80::1", ::if_nametoindex("wifi0"));
-    const auto cellular = addressOf("fe80::1", ::if_nametoindex("pdp_ip0"));
-    EXPECT_EQ(interfaceWithoutCellular(reinterpret_cast<const sockaddr&>(wifi), files), "wifi0");
-    EXPECT_EQ(interfaceWithoutCellular(reinterpret_cast<const sockaddr&>(cellular), files), "");
-  });
+  EXPECT_EQ(chosenFor(addressOf("fe80::1", indexOf("wifi0"))), "wifi0");
+  EXPECT_EQ(chosenFor(addressOf("fe80::1", indexOf("pdp_ip0"))), "cellular");
 }
 
 TEST_F(CellularRuleTest, WithoutARouteNoInterfaceIsChosen) {
-  EXPECT_EQ(chosenFor("203.0.113.9"), "");
+  EXPECT_EQ(chosenFor("203.0.113.9"), "none");
   sockaddr_storage local{};
   local.ss_family = AF_UNIX;
-  EXPECT_FALSE(interfaceTowards(reinterpret_cast<const sockaddr&>(local)).has_value());
+  EXPECT_EQ(chosenFor(local), "none");
 }
 
 TEST_F(CellularRuleTest, NamesAreNotLookedUpWhileAllRoutesAreCellular) {
