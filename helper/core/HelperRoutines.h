@@ -2,7 +2,10 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include "Helper/Shared/Server/HelperServerUtils.h"
 #include "helper/core/UnbuiltRoutines.h"
+#include "helper/heartbeat/CellularHeartbeat.h"
+#include "helper/lasd/LASDUpdater.h"
 #include "helper/mobile/RadioLogging.h"
 #include "helper/preferences/PreferenceTransfer.h"
 
@@ -15,11 +18,14 @@ class HelperRoutines final : public UnbuiltRoutines {
   struct Areas {
     PreferenceTransfer& preferences;
     RadioLogging& radioLogging;
+    LASDUpdater& lasd;
+    CellularHeartbeat& heartbeat;
+    PortServerRegistry& registry = PortServerRegistry::shared();
   };
   explicit HelperRoutines(const Areas& areas) noexcept : areas_(areas) {}
 
-  KernelReturn server_BVMobileHelperSetPreferenceValue(PortName port, char* domain, char* key, const void* value,
-                                                       std::uint32_t length) override {
+  KernelReturn server_BVMobileHelperSetPreferenceValue(PortName port, char* domain, char* key,
+                                                       const void* value, std::uint32_t length) override {
     return areas_.preferences.setPreferenceValue(port, domain, key, value, length);
   }
   KernelReturn server_BVMobileHelperCopyPreferenceValue(PortName port, char* domain, char* key,
@@ -30,11 +36,24 @@ class HelperRoutines final : public UnbuiltRoutines {
                                                            OutOfLinePayload* value) override {
     return areas_.preferences.copyAppPreferenceValue(port, domain, key, value);
   }
-  KernelReturn server_BVMobileHelperLoadPlistFile(PortName port, char* path, OutOfLinePayload* contents) override {
+  KernelReturn server_BVMobileHelperLoadPlistFile(PortName port, char* path,
+                                                  OutOfLinePayload* contents) override {
     return areas_.preferences.loadPlistFile(port, path, contents);
   }
   KernelReturn server_BVMobileHelperEnableRadioManagerLogs(PortName port, std::int32_t enable) override {
     return areas_.radioLogging.BVMobileHelperEnableRadioManagerLogs(port, enable);
+  }
+  KernelReturn server_BVMobileHelperCellularHeartbeat(PortName port, std::int32_t value) override {
+    ServerContext* const server = LookupServer(areas_.registry, port);
+    if (server == nullptr) return kern::failure;
+    areas_.heartbeat.setHeartbeat(*server, value != 0);
+    return kern::success;
+  }
+  KernelReturn server_BVMobileHelperCheckLASDUpdate(PortName port, std::int32_t mask) override {
+    ServerContext* const server = LookupServer(areas_.registry, port);
+    if (server == nullptr) return kern::failure;
+    areas_.lasd.checkForUpdate(*server, static_cast<std::uint32_t>(mask));
+    return kern::success;
   }
 
  private:

@@ -17,10 +17,13 @@
 #include "platform/ipc/linux/SystemBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/log/linux/SystemLog.h"
+#include "platform/messageport/linux/ChannelMessagePorts.h"
+#include "platform/net/linux/SystemEchoNetwork.h"
 #include "platform/preferences/linux/FilePreferences.h"
 #include "platform/radio/linux/ModemManagerLogs.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/security/linux/EntitlementFiles.h"
+#include "platform/web/linux/LoadedWebModule.h"
 
 namespace brenvik {
 namespace {
@@ -64,15 +67,33 @@ int run() {
   ModemManagerLogs radio(queues);
   RadioLogging radioLogging(radio);
 
-  HelperRoutines routines({.preferences = preferenceTransfer, .radioLogging = radioLogging});
+  LoadedWebModule web(queues);
+  ChannelMessagePorts messagePorts(BRENVIK_BOOTSTRAP_DIRECTORY);
+  const auto& lasd = LASDUpdater::shared();
+  lasd->configure({.queues = queues,
+                   .web = web.webClient(),
+                   .gunzip = web.gunzip(),
+                   .preferences = preferences,
+                   .messagePorts = messagePorts});
+  SystemEchoNetwork echoNetwork;
+  CellularHeartbeat& heartbeat = CellularHeartbeat::shared();
+  heartbeat.configure({.queues = queues, .network = echoNetwork});
+
+  HelperRoutines routines({.preferences = preferenceTransfer,
+                           .radioLogging = radioLogging,
+                           .lasd = *lasd,
+                           .heartbeat = heartbeat});
   const RequestTable requests(routines);
-  const ServerPlatform platform{ports, bootstrap, sources, *loop,
-                                [&](const char* entitlement, const AuditToken& caller) {
-                                  const auto task = security.makeTask(caller);
-                                  return task != nullptr &&
-                                         task->copyEntitlement(entitlement).value.asBoolean().value_or(false);
-                                }};
+  const ServerPlatform platform{
+      ports, bootstrap, sources, *loop, [&](const char* entitlement, const AuditToken& caller) {
+        const auto task = security.makeTask(caller);
+        return task != nullptr && task->copyEntitlement(entitlement).value.asBoolean().value_or(false);
+      }};
   const int status = runHelper(baseband, platform, requests);
+  // The first lets a transfer under way end, for which a check would wait.
+  web.shutDown();
+  lasd->shutDown();
+  heartbeat.shutDown();
   setLogSink(nullptr);
   return status;
 }

@@ -92,7 +92,8 @@ class LoadedWebModule::Module {
  private:
   void load() {
     if (closed_ || std::exchange(looked_, true)) return;
-    std::string reason = "no place to look";
+    if (places_.empty()) places_ = webModulePlaces();
+    std::string reason;
     for (const std::string& place : places_) {
       // Everything bound now: a symbol that is missing shows here and not in the middle of a transfer.
       void* const handle = ::dlopen(place.c_str(), RTLD_NOW | RTLD_LOCAL);
@@ -118,8 +119,8 @@ class LoadedWebModule::Module {
   }
 
   WorkQueues& queues_;
-  const std::vector<std::string> places_;
   std::mutex mutex_;  // guards everything below
+  std::vector<std::string> places_;
   bool looked_ = false;
   bool closed_ = false;
   std::shared_ptr<WebClient> client_;

@@ -20,8 +20,8 @@ std::vector<std::string> webModulePlaces();
 // cannot be loaded, that is logged once, requests complete as clientUnavailable and gunzip is unavailable.
 class LoadedWebModule {
  public:
-  // The queues outlive it.
-  explicit LoadedWebModule(WorkQueues& queues, std::vector<std::string> places = webModulePlaces());
+  // The queues outlive it. Without places it looks in webModulePlaces().
+  explicit LoadedWebModule(WorkQueues& queues, std::vector<std::string> places = {});
   LoadedWebModule(const LoadedWebModule&) = delete;
   LoadedWebModule& operator=(const LoadedWebModule&) = delete;
   // As shutDown(). Whoever holds a session or a request lets go of it first.
