@@ -2,9 +2,12 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include "Helper/Shared/Server/HelperServerUtils.h"
 #include "helper/core/UnbuiltRoutines.h"
+#include "helper/heartbeat/CellularHeartbeat.h"
 #include "helper/labels/ChannelRemap.h"
 #include "helper/labels/LabelRoutines.h"
+#include "helper/lasd/LASDUpdater.h"
 #include "helper/mobile/RadioLogging.h"
 #include "helper/preferences/PreferenceTransfer.h"
 
@@ -19,11 +22,14 @@ class HelperRoutines final : public UnbuiltRoutines {
     RadioLogging& radioLogging;
     LabelRoutines& labels;
     ChannelRemap& channelRemap;
+    LASDUpdater& lasd;
+    CellularHeartbeat& heartbeat;
+    PortServerRegistry& registry = PortServerRegistry::shared();
   };
   explicit HelperRoutines(const Areas& areas) noexcept : areas_(areas) {}
 
-  KernelReturn server_BVMobileHelperSetPreferenceValue(PortName port, char* domain, char* key, const void* value,
-                                                       std::uint32_t length) override {
+  KernelReturn server_BVMobileHelperSetPreferenceValue(PortName port, char* domain, char* key,
+                                                       const void* value, std::uint32_t length) override {
     return areas_.preferences.setPreferenceValue(port, domain, key, value, length);
   }
   KernelReturn server_BVMobileHelperCopyPreferenceValue(PortName port, char* domain, char* key,
@@ -34,7 +40,8 @@ class HelperRoutines final : public UnbuiltRoutines {
                                                            OutOfLinePayload* value) override {
     return areas_.preferences.copyAppPreferenceValue(port, domain, key, value);
   }
-  KernelReturn server_BVMobileHelperLoadPlistFile(PortName port, char* path, OutOfLinePayload* contents) override {
+  KernelReturn server_BVMobileHelperLoadPlistFile(PortName port, char* path,
+                                                  OutOfLinePayload* contents) override {
     return areas_.preferences.loadPlistFile(port, path, contents);
   }
   KernelReturn server_BVMobileHelperEnableRadioManagerLogs(PortName port, std::int32_t enable) override {
@@ -53,6 +60,18 @@ class HelperRoutines final : public UnbuiltRoutines {
   KernelReturn server_BVMobileHelperRemapContactsChannel(PortName, char* from, char* to,
                                                          std::uint8_t* success) override {
     return areas_.channelRemap.RemapContactsChannel(from, to, success);
+  }
+  KernelReturn server_BVMobileHelperCellularHeartbeat(PortName port, std::int32_t value) override {
+    ServerContext* const server = LookupServer(areas_.registry, port);
+    if (server == nullptr) return kern::failure;
+    areas_.heartbeat.setHeartbeat(*server, value != 0);
+    return kern::success;
+  }
+  KernelReturn server_BVMobileHelperCheckLASDUpdate(PortName port, std::int32_t mask) override {
+    ServerContext* const server = LookupServer(areas_.registry, port);
+    if (server == nullptr) return kern::failure;
+    areas_.lasd.checkForUpdate(*server, static_cast<std::uint32_t>(mask));
+    return kern::success;
   }
 
  private:

@@ -23,10 +23,13 @@
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/labeler/linux/CatalogueLabeler.h"
 #include "platform/log/linux/SystemLog.h"
+#include "platform/messageport/linux/ChannelMessagePorts.h"
+#include "platform/net/linux/SystemEchoNetwork.h"
 #include "platform/preferences/linux/FilePreferences.h"
 #include "platform/radio/linux/ModemManagerLogs.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/security/linux/EntitlementFiles.h"
+#include "platform/web/linux/LoadedWebModule.h"
 
 namespace brenvik {
 namespace {
@@ -81,16 +84,34 @@ int run() {
   SqliteContacts contacts(mobileHome);
   ChannelRemap channelRemap(contacts);
 
+  LoadedWebModule web(queues);
+  ChannelMessagePorts messagePorts(BRENVIK_BOOTSTRAP_DIRECTORY);
+  const auto& lasd = LASDUpdater::shared();
+  lasd->configure({.queues = queues,
+                   .web = web.webClient(),
+                   .gunzip = web.gunzip(),
+                   .preferences = preferences,
+                   .messagePorts = messagePorts});
+  SystemEchoNetwork echoNetwork;
+  CellularHeartbeat& heartbeat = CellularHeartbeat::shared();
+  heartbeat.configure({.queues = queues, .network = echoNetwork});
+
   HelperRoutines routines({.preferences = preferenceTransfer,
                            .radioLogging = radioLogging,
                            .labels = labels,
-                           .channelRemap = channelRemap});
+                           .channelRemap = channelRemap,
+                           .lasd = *lasd,
+                           .heartbeat = heartbeat});
   const RequestTable requests(routines);
   const ServerPlatform platform{ports, bootstrap, sources, *loop,
                                 [&entitlements](const char* entitlement, const AuditToken& caller) {
                                   return entitlements.HasEntitlement(entitlement, caller);
                                 }};
   const int status = runHelper(baseband, platform, requests);
+  // The first lets a transfer under way end, for which a check would wait.
+  web.shutDown();
+  lasd->shutDown();
+  heartbeat.shutDown();
   setLogSink(nullptr);
   return status;
 }

@@ -1,0 +1,60 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <span>
+#include <string>
+#include <vector>
+
+#include "platform/gzip/Gunzip.h"
+#include "platform/runloop/WorkQueue.h"
+#include "platform/web/WebClient.h"
+
+namespace brenvik {
+
+// Disk space that unpacking leaves free, in bytes: other programs keep their state on the same disk.
+inline constexpr std::uint64_t kDiskReserve = std::uint64_t{16} << 20;
+
+enum class WifiOnly : bool { no, yes };
+
+// Downloads one URL into memory and can then write what came, gunzipped, to a file. Made for one fetch, on
+// the caller's stack. One thread at a time, and not the one that runs this object's own queue.
+class HttpFetcher {
+ public:
+  // What it works with; all of it outlives the fetcher.
+  struct Parts {
+    WorkQueues& queues;
+    WebClient& web;
+    Gunzip& gunzip;
+    std::uint64_t diskReserve = kDiskReserve;
+  };
+
+  explicit HttpFetcher(const Parts& parts);
+  HttpFetcher(const HttpFetcher&) = delete;
+  HttpFetcher& operator=(const HttpFetcher&) = delete;
+
+  // Blocks until the HTTP client reports, without a limit of its own. True when a body came that is not
+  // empty.
+  bool fetch(const std::string& url, WifiOnly wifiOnly);
+
+  // Writes the body, which must have been delivered as a gzip file, uncompressed to the path. The file is on
+  // the disk when this returns true; when it returns false, there is none.
+  bool uncompressTo(const std::string& path);
+
+  // The body, as long as this object lives and fetches nothing else.
+  std::span<const std::byte> bodyAsData() const noexcept { return body_; }
+
+ private:
+  void completed(const std::string& url, const std::shared_ptr<WebResponse>& response);
+  bool uncompressInto(int file);
+
+  const Parts parts_;
+  const std::shared_ptr<WorkQueue> queue_;
+  std::vector<std::byte> body_;  // of the last successful response
+  HeaderMap headers_;            // likewise
+};
+
+}  // namespace brenvik

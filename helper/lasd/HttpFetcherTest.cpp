@@ -1,0 +1,275 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "helper/lasd/HttpFetcher.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <thread>
+
+#include "helper/lasd/LasdTestSupport.h"
+
+namespace brenvik {
+namespace {
+
+constexpr const char kUrl[] = "https://server.example/file";
+
+class HttpFetcherTest : public LasdTest {
+ protected:
+  std::string path() const { return folder / "output"; }
+  std::string textOf(const HttpFetcher& fetcher) {
+    const auto bytes = fetcher.bodyAsData();
+    return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
+  }
+  // A fetcher that has this body, served with these headers.
+  std::unique_ptr<HttpFetcher> fetched(const std::string& body, HeaderMap headers,
+                                       std::uint64_t diskReserve = 0) {
+    web.answer(kUrl, 200, body, std::move(headers));
+    auto fetcher = std::make_unique<HttpFetcher>(fetcherParts(diskReserve));
+    EXPECT_TRUE(fetcher->fetch(kUrl, WifiOnly::yes));
+    log.clear();
+    return fetcher;
+  }
+  const HeaderMap gzipType{{"Content-Type", "application/gzip"}};
+};
+
+// ---- fetch ----
+
+TEST_F(HttpFetcherTest, ABodyIsFetchedAndLoggedOnAUtilityQueueOfItsOwn) {
+  web.answer(kUrl, 200, "body");
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_EQ(queues.made, (std::vector<std::pair<std::string, QualityOfService>>{
+                             {"com.norvale.httpdownloadqueue", QualityOfService::utility}}));
+  EXPECT_TRUE(fetcher.fetch(kUrl, WifiOnly::yes));
+  EXPECT_EQ(textOf(fetcher), "body");
+  EXPECT_EQ(log.entries(), (Lines{info("Fetching URL https://server.example/file"),
+                                  info("URL retrieved https://server.example/file, size: 4 ")}));
+  ASSERT_EQ(web.seen().size(), 1U);
+  const auto seen = web.seen()[0];
+  EXPECT_EQ(seen.type, WebRequestType::get);
+  EXPECT_EQ(seen.url, kUrl);
+  EXPECT_EQ(seen.headers, (HeaderMap{{"Accept-Encoding", "gzip"}}));
+  EXPECT_FALSE(seen.cellularAllowed);
+  EXPECT_EQ(seen.queueLabel, "com.norvale.httpdownloadqueue");
+  EXPECT_EQ(seen.bodySize, 0U);
+  EXPECT_EQ(seen.timeLimit.count(), 0) << "no limit beside the client's own";
+}
+
+TEST_F(HttpFetcherTest, CellularStaysAllowedUnlessTheFetchIsWifiOnly) {
+  web.answer(kUrl, 200, "body");
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_TRUE(fetcher.fetch(kUrl, WifiOnly::no));
+  EXPECT_TRUE(web.seen().at(0).cellularAllowed);
+}
+
+TEST_F(HttpFetcherTest, AnEmptyUrlFailsAtOnceAndMakesNoRequest) {
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_FALSE(fetcher.fetch("", WifiOnly::yes));
+  EXPECT_EQ(log.entries(), Lines{error("URL is empty")});
+  EXPECT_TRUE(web.seen().empty());
+}
+
+TEST_F(HttpFetcherTest, AUrlThatNoRequestCanBeMadeOfFails) {
+  web.refuse("nonsense");
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_FALSE(fetcher.fetch("nonsense", WifiOnly::yes));
+  EXPECT_EQ(log.entries(),
+            (Lines{info("Fetching URL nonsense"), error("Cannot create HTTP request for URL nonsense")}));
+}
+
+TEST_F(HttpFetcherTest, EveryStatusOtherThan200FailsAndIsNamed) {
+  for (const auto& [status, text] :
+       std::vector<std::pair<int, std::string>>{{304, "Not Modified"},
+                                                {404, "Not Found"},
+                                                {201, "Created"},
+                                                {206, "Partial Content"},
+                                                {500, "Internal Server Error"}}) {
+    log.clear();
+    web.answer(kUrl, status, "a body all the same");
+    HttpFetcher fetcher(fetcherParts());
+    EXPECT_FALSE(fetcher.fetch(kUrl, WifiOnly::yes));
+    EXPECT_EQ(textOf(fetcher), "");
+    EXPECT_EQ(
+        log.entries(),
+        (Lines{
+            info("Fetching URL https://server.example/file"),
+            error("HTTP request failed for URL https://server.example/file with error no error errorcode " +
+                  std::to_string(status) + " (" + text + ")")}));
+  }
+}
+
+TEST_F(HttpFetcherTest, AFailedTransferIsNamed) {
+  web.fail(kUrl, WebErrorKind::certificateClock);
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_FALSE(fetcher.fetch(kUrl, WifiOnly::yes));
+  EXPECT_EQ(log.entries().back(), error("HTTP request failed for URL https://server.example/file with error "
+                                        "server certificate not valid at "
+                                        "this time, check the system clock errorcode 0 (no status)"));
+}
+
+TEST_F(HttpFetcherTest, A200ThatDidNotArriveWholeFails) {
+  WebResponse response;
+  response.errorKind = WebErrorKind::connectionLost;
+  response.statusCode = 200;
+  response.body.resize(10);
+  web.answer(kUrl, response);
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_FALSE(fetcher.fetch(kUrl, WifiOnly::yes));
+  EXPECT_TRUE(fetcher.bodyAsData().empty());
+}
+
+TEST_F(HttpFetcherTest, A200ResponseWithAnEmptyBodyFailsWithoutAFailureLine) {
+  web.answer(kUrl, 200, "");
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_FALSE(fetcher.fetch(kUrl, WifiOnly::yes));
+  EXPECT_EQ(log.entries(), (Lines{info("Fetching URL https://server.example/file"),
+                                  info("URL retrieved https://server.example/file, size: 0 ")}));
+}
+
+TEST_F(HttpFetcherTest, NoResponseAtAllFails) {
+  web.answerNothing(kUrl);
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_FALSE(fetcher.fetch(kUrl, WifiOnly::yes));
+  EXPECT_EQ(log.entries(), (Lines{info("Fetching URL https://server.example/file"),
+                                  error("Did not receive HTTP response!")}));
+}
+
+TEST_F(HttpFetcherTest, FetchBlocksUntilTheClientReports) {
+  web.answer(kUrl, 200, "late");
+  web.holdAnswers();
+  HttpFetcher fetcher(fetcherParts());
+  std::atomic<bool> returned{false};
+  std::thread waiting([&] {
+    EXPECT_TRUE(fetcher.fetch(kUrl, WifiOnly::yes));
+    returned = true;
+  });
+  while (web.seen().empty()) std::this_thread::yield();
+  EXPECT_FALSE(returned);
+  web.releaseAnswers();
+  waiting.join();
+  EXPECT_EQ(textOf(fetcher), "late");
+}
+
+TEST_F(HttpFetcherTest, ASecondFetchClearsWhatTheFirstBrought) {
+  const auto fetcher = fetched(gzipOf("x"), gzipType);
+  web.answer("https://server.example/gone", 404, "");
+  EXPECT_FALSE(fetcher->fetch("https://server.example/gone", WifiOnly::yes));
+  EXPECT_TRUE(fetcher->bodyAsData().empty());
+  log.clear();
+  EXPECT_FALSE(fetcher->uncompressTo(path()));
+  EXPECT_EQ(log.entries(), Lines{error("Cannot uncompress downloaded buffer without a response!")});
+}
+
+// ---- uncompressTo ----
+
+TEST_F(HttpFetcherTest, AGzipBodyIsWrittenUncompressedAndReplacesWhatWasThere) {
+  const std::string content(1'000'000, 'c');
+  const auto fetcher = fetched(gzipOf(content), gzipType);
+  std::ofstream(path()) << std::string(2'000'000, 'o');
+  EXPECT_TRUE(fetcher->uncompressTo(path()));
+  EXPECT_TRUE(contentOf(path()) == content);
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(HttpFetcherTest, SeveralMembersAreWrittenOneAfterTheOther) {
+  const auto fetcher = fetched(gzipOf("one ") + gzipOf("two"), gzipType);
+  EXPECT_TRUE(fetcher->uncompressTo(path()));
+  EXPECT_EQ(contentOf(path()), "one two");
+}
+
+TEST_F(HttpFetcherTest, WithoutAResponseThereIsNothingToUncompress) {
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_FALSE(fetcher.uncompressTo(path()));
+  EXPECT_EQ(log.entries(), Lines{error("Cannot uncompress downloaded buffer without a response!")});
+  EXPECT_FALSE(std::filesystem::exists(path()));
+}
+
+TEST_F(HttpFetcherTest, AMissingContentTypeFailsEvenWhenTheBytesAreGzip) {
+  const auto fetcher = fetched(gzipOf("content"), {{"Content-Encoding", "gzip"}});
+  EXPECT_FALSE(fetcher->uncompressTo(path()));
+  EXPECT_EQ(log.entries(), Lines{error("Cannot find Content-Type header in response!")});
+  EXPECT_FALSE(std::filesystem::exists(path()));
+}
+
+TEST_F(HttpFetcherTest, TheContentTypeMustHoldTheWordGzipInSmallLetters) {
+  for (const char* type : {"application/x-gzip", "application/gzip; charset=binary", "gzip", "notgzipped"}) {
+    EXPECT_TRUE(fetched(gzipOf("content"), {{"content-type", type}})->uncompressTo(path())) << type;
+  }
+  for (const std::string type : {"application/GZIP", "application/octet-stream", "Gzip", ""}) {
+    const auto fetcher = fetched(gzipOf("content"), {{"Content-Type", type}});
+    EXPECT_FALSE(fetcher->uncompressTo(path()));
+    EXPECT_EQ(log.entries(),
+              Lines{error("Expected to find gzip in Content-Type header, found " + type + " instead")});
+  }
+}
+
+TEST_F(HttpFetcherTest, AnOutputFileThatCannotBeOpenedFailsWithItsReason) {
+  const std::string missing = folder / "missing" / "output";
+  auto fetcher = fetched(gzipOf("content"), gzipType);
+  EXPECT_FALSE(fetcher->uncompressTo(missing));
+  EXPECT_EQ(log.entries(),
+            Lines{error("Cannot open output file " + missing + ": No such file or directory")});
+  log.clear();
+  EXPECT_FALSE(fetcher->uncompressTo(folder));
+  EXPECT_EQ(log.entries(), Lines{error("Cannot open output file " + folder.string() + ": Is a directory")});
+}
+
+TEST_F(HttpFetcherTest, NothingIsWrittenThroughALinkOrIntoAPipe) {
+  const auto fetcher = fetched(gzipOf("content"), gzipType);
+  std::ofstream(folder / "precious") << "precious";
+  std::filesystem::create_symlink("precious", path());
+  EXPECT_FALSE(fetcher->uncompressTo(path()));
+  EXPECT_EQ(log.entries(),
+            Lines{error("Cannot open output file " + path() + ": Too many levels of symbolic links")});
+  EXPECT_EQ(contentOf(folder / "precious"), "precious");
+  const std::string pipe = folder / "pipe";
+  ASSERT_EQ(::mkfifo(pipe.c_str(), 0600), 0);
+  EXPECT_FALSE(fetcher->uncompressTo(pipe));
+}
+
+TEST_F(HttpFetcherTest, ACorruptGzipBodyLeavesNoFile) {
+  const std::string good = gzipOf(std::string(500'000, 'x') + "end");
+  std::string wrongChecksum = good;
+  wrongChecksum[wrongChecksum.size() - 8] ^= 1;
+  for (const std::string& body : {std::string("not gzip"), wrongChecksum, good.substr(0, good.size() - 1),
+                                  good.substr(0, good.size() / 2), good + "trailing bytes"}) {
+    const auto fetcher = fetched(body, gzipType);
+    std::ofstream(path()) << "older";
+    EXPECT_FALSE(fetcher->uncompressTo(path()));
+    EXPECT_EQ(log.entries(), Lines{error("Could not uncompress HTTP response to " + path() + "!")});
+    EXPECT_FALSE(std::filesystem::exists(path()));
+  }
+}
+
+TEST_F(HttpFetcherTest, APartialFileThatCannotBeRemovedIsTold) {
+  // The file is taken away while it is written, so that there is none to remove.
+  class Thief final : public Gunzip {
+   public:
+    explicit Thief(std::string path) : path_(std::move(path)) {}
+    GunzipResult gunzip(std::span<const std::byte>, std::uint64_t, const Receiver&) noexcept override {
+      std::filesystem::remove(path_);
+      return GunzipResult::damaged;
+    }
+
+   private:
+    const std::string path_;
+  } thief(path());
+  web.answer(kUrl, 200, "x", gzipType);
+  HttpFetcher fetcher({queues, web, thief, 0});
+  ASSERT_TRUE(fetcher.fetch(kUrl, WifiOnly::yes));
+  log.clear();
+  EXPECT_FALSE(fetcher.uncompressTo(path()));
+  EXPECT_EQ(log.entries(), (Lines{error("Could not uncompress HTTP response to " + path() + "!"),
+                                  error("Failed to remove partially uncompressed file at " + path() +
+                                        ": No such file or directory")}));
+}
+
+TEST_F(HttpFetcherTest, ABombStopsBeforeTheReserveOfTheDiskIsTouched) {
+  const auto fetcher = fetched(gzipOf(std::string(1000, 'x')), gzipType, ~std::uint64_t{0} / 2);
+  EXPECT_FALSE(fetcher->uncompressTo(path()));
+  EXPECT_EQ(log.entries(), Lines{error("Could not uncompress HTTP response to " + path() + "!")});
+  EXPECT_FALSE(std::filesystem::exists(path()));
+}
+
+}  // namespace
+}  // namespace brenvik

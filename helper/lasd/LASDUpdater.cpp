@@ -1,0 +1,163 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "helper/lasd/LASDUpdater.h"
+
+#include <exception>
+#include <string_view>
+#include <utility>
+
+#include "helper/lasd/DatabaseTypes.h"
+#include "helper/lasd/Notifications.h"
+#include "helper/lasd/VersionText.h"
+#include "platform/log/Log.h"
+#include "platform/plist/PropertyListCodec.h"
+
+namespace brenvik {
+namespace {
+
+constexpr const char kQueueLabel[] = "LASDUpdater";
+
+// Made with the other statics, let go of at exit.
+const std::shared_ptr<LASDUpdater> sharedUpdater = std::make_shared<LASDUpdater>();
+
+PropertyList onlyDictionary(PropertyList value) {
+  return value && value.is(PropertyList::Type::dictionary) ? std::move(value) : PropertyList();
+}
+
+PropertyList onlyString(PropertyList value) {
+  return value && value.is(PropertyList::Type::string) ? std::move(value) : PropertyList();
+}
+
+std::string_view textOf(const PropertyList& string) { return string.asString().value_or(std::string_view()); }
+
+// For a log line.
+std::string shown(const PropertyList& string) { return string ? std::string(textOf(string)) : "(null)"; }
+
+}  // namespace
+
+const char* const kManifestUrl = "https://" BRENVIK_LASD_HOST "/1/v3/lasd.plist";
+
+const std::shared_ptr<LASDUpdater>& LASDUpdater::shared() noexcept { return sharedUpdater; }
+
+LASDUpdater::~LASDUpdater() = default;
+
+void LASDUpdater::configure(const Parts& parts) { parts_ = std::make_unique<Parts>(parts); }
+
+void LASDUpdater::shutDown() noexcept { queue_.reset(); }
+
+void LASDUpdater::checkForUpdate(ServerContext& server, std::uint32_t mask) {
+  logUnified(LogLevel::info, "Trying to see if update available for mask %x", mask);
+  const std::uint32_t token = AcquireBusyToken(server);
+  const std::weak_ptr<LASDUpdater> weak = weak_from_this();
+  auto self = weak.lock();
+  if (self == nullptr) std::terminate();
+  // Made here and not before, so that a process which never needs it does not pay for it.
+  if (queue_ == nullptr) queue_ = parts_->queues.makeSerial(kQueueLabel, QualityOfService::standard);
+  queue_->post([self = std::move(self), &server, mask, token] { self->check(server, mask, token); });
+}
+
+void LASDUpdater::check(ServerContext& server, std::uint32_t mask, std::uint32_t token) {
+  loadVersions(kVersionsDomain, VersionSource::preferences, mask);
+  const std::int64_t result = loadVersions(parts_->manifestUrl, VersionSource::manifest, mask);
+  if (result != 0 && result != kNotFetched) {
+    for (const std::int32_t type : kDatabaseTypesInOrder) {
+      if ((result & type) == 0) continue;
+      const std::uint32_t own = AcquireBusyToken(server);
+      updateDatabase(type);
+      (void)ReleaseBusyToken(server, own);  // one bit, as it was given
+    }
+  } else if (result == 0) {
+    logUnified(LogLevel::error, "No update required for any databases");
+    sendNotification(parts_->messagePorts, makeNotification(NotificationKind::noUpdateRequired, 0));
+  } else {
+    sendNotification(parts_->messagePorts, makeNotification(NotificationKind::updateFailed, 0));
+  }
+  (void)ReleaseBusyToken(server, token);  // likewise
+}
+
+std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource kind, std::uint32_t mask) {
+  if (kind == VersionSource::preferences) {
+    logUnified(LogLevel::info, "Reading local resource %s", source.c_str());
+    for (const std::int32_t type : kDatabaseTypesInOrder) {
+      if ((mask & static_cast<std::uint32_t>(type)) == 0) continue;
+      versions_[type] = onlyDictionary(parts_->preferences.copyValue(
+          keyOfDatabaseType(type), source, UserScope::currentUser, HostScope::anyHost));
+    }
+    return 0;
+  }
+
+  HttpFetcher fetcher({parts_->queues, parts_->web, parts_->gunzip, parts_->diskReserve});
+  if (!fetcher.fetch(source, WifiOnly::yes)) {
+    logUnified(LogLevel::error, "Could not fetch data from source %s", source.c_str());
+    return kNotFetched;
+  }
+  const PropertyList manifest = onlyDictionary(parsePropertyList(fetcher.bodyAsData()));
+  if (!manifest) {
+    // Told apart from a failed fetch on purpose: the caller takes it for "nothing to do".
+    logUnified(LogLevel::error, "Could not create version dictionary from downloaded plist!");
+    return 0;
+  }
+  return compareWithManifest(manifest, mask);
+}
+
+std::int64_t LASDUpdater::compareWithManifest(const PropertyList& manifest, std::uint32_t mask) {
+  std::int64_t result = 0;
+  for (auto& [type, record] : versions_) {
+    if ((static_cast<std::uint32_t>(type) & mask) == 0 || isUpToDate(manifest, type)) continue;
+    const PropertyList serverEntry = onlyDictionary(manifest.find(nameOfDatabaseType(type)));
+    if (!serverEntry) continue;
+    record = serverEntry;
+    result |= type;
+  }
+  return result;
+}
+
+bool LASDUpdater::isUpToDate(const PropertyList& manifest, std::int32_t type) {
+  if (!manifest) return false;
+  const char* const name = nameOfDatabaseType(type);
+  const PropertyList serverEntry = onlyDictionary(manifest.find(name));
+  if (!serverEntry) {
+    logUnified(LogLevel::info, "%s db is not present locally, update required", name);
+    return false;
+  }
+  const PropertyList serverVersion = onlyString(serverEntry.find(kVersionKey));
+  const PropertyList localRecord = versions_[type];
+  const PropertyList localVersion = onlyString(localRecord.find(kVersionKey));
+  if (!localRecord || (!localVersion && serverVersion)) {
+    logUnified(LogLevel::info,
+               "We have don't have a previously downloaded %s database, server has %s, update required", name,
+               shown(serverVersion).c_str());
+    return false;
+  }
+  if (localVersion && serverVersion && sameVersion(textOf(localVersion), textOf(serverVersion))) {
+    logUnified(LogLevel::info, "%s version %s matches server version", name, shown(localVersion).c_str());
+    return true;
+  }
+  logUnified(LogLevel::info, "We have %s version %s, server has %s, update required", name,
+             shown(localVersion).c_str(), shown(serverVersion).c_str());
+  return false;
+}
+
+void LASDUpdater::updateDatabase(std::int32_t type) {
+  const char* const name = nameOfDatabaseType(type);
+  const auto found = versions_.find(type);
+  const PropertyList record = found != versions_.end() ? found->second : PropertyList();
+  const PropertyList url = onlyString(record.find(kContentUrlKey));
+  if (!url) {
+    logUnified(LogLevel::error, "Could not find %s database URL", name);
+    return;
+  }
+  if (textOf(url).empty()) {
+    logUnified(LogLevel::error, "URL for %s database is empty", name);
+    return;
+  }
+  DatabaseInstaller installer({{parts_->queues, parts_->web, parts_->gunzip, parts_->diskReserve},
+                               parts_->preferences,
+                               parts_->directory});
+  const bool ok = installer.downloadAndInstall(std::string(textOf(url)), type, record);
+  sendNotification(
+      parts_->messagePorts,
+      makeNotification(ok ? NotificationKind::updateAvailable : NotificationKind::updateFailed, type));
+}
+
+}  // namespace brenvik

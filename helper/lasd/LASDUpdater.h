@@ -1,0 +1,84 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <string>
+
+#include "Helper/Shared/Server/BusyTokens.h"
+#include "helper/lasd/DatabaseInstaller.h"
+#include "helper/lasd/HttpFetcher.h"
+#include "platform/messageport/MessagePort.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/preferences/PreferencesStore.h"
+#include "platform/runloop/WorkQueue.h"
+
+namespace brenvik {
+
+// Where the compiled-in update server keeps the manifest.
+extern const char* const kManifestUrl;
+
+// Keeps the location-aware service databases up to date: compares the versions recorded here with the update
+// server's manifest, has every database installed that differs, and tells the telephony daemon what came of
+// it. Checks are made one after the other on a queue of its own. Owned by shared_ptr only.
+class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
+ public:
+  // What it works with; all of it outlives the updater, or its shutDown().
+  struct Parts {
+    WorkQueues& queues;
+    WebClient& web;
+    Gunzip& gunzip;
+    PreferencesStore& preferences;
+    MessagePorts& messagePorts;
+    std::string manifestUrl = kManifestUrl;
+    std::string directory = kDatabaseDirectory;
+    std::uint64_t diskReserve = kDiskReserve;
+  };
+  enum class VersionSource { preferences, manifest };
+  // loadVersions() could not fetch the manifest; as a mask, no set of types is that large.
+  static constexpr std::int64_t kNotFetched = 0xFFFFFFFF;
+
+  LASDUpdater() noexcept = default;
+  LASDUpdater(const LASDUpdater&) = delete;
+  LASDUpdater& operator=(const LASDUpdater&) = delete;
+  ~LASDUpdater();
+
+  // The process's own, made before main() begins. It costs nothing until the first check.
+  static const std::shared_ptr<LASDUpdater>& shared() noexcept;
+
+  // To be called once, before anything else.
+  void configure(const Parts& parts);
+
+  // Starts a check of the types in the mask and returns at once; other bits are ignored. Holds a busy token
+  // until the check's last notification is sent. Main loop only; the server outlives the check. Ends the
+  // process when the updater is on its way out.
+  void checkForUpdate(ServerContext& server, std::uint32_t mask);
+
+  // Ends the queue after the check that runs, which may wait for the HTTP client. Main loop only.
+  void shutDown() noexcept;
+
+  // ---- on the queue, or with none running ----
+
+  // Reads the version records of the types in the mask, from the preferences domain or by the manifest's URL.
+  // Of the manifest: the mask of the types that need an update, whose entries are then the server's; 0 too
+  // when it is no manifest; kNotFetched. Of the preferences: 0.
+  std::int64_t loadVersions(const std::string& source, VersionSource kind, std::uint32_t mask);
+  // The second half of the above: what of a manifest is new.
+  std::int64_t compareWithManifest(const PropertyList& manifest, std::uint32_t mask);
+  bool isUpToDate(const PropertyList& manifest, std::int32_t type);
+  // Has the type's database installed and tells what came of it.
+  void updateDatabase(std::int32_t type);
+
+ private:
+  void check(ServerContext& server, std::uint32_t mask, std::uint32_t token);
+
+  std::unique_ptr<Parts> parts_;
+  // By type, the record found here or, once it needs an update, the server's; none when there is no record.
+  std::map<std::int32_t, PropertyList> versions_;  // on the queue only
+  // Last, so that it ends first: its tasks use everything above.
+  std::shared_ptr<WorkQueue> queue_;
+};
+
+}  // namespace brenvik

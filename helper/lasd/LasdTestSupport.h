@@ -1,0 +1,102 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <gtest/gtest.h>
+#include <zlib.h>
+
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <memory>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "helper/lasd/HttpFetcher.h"
+#include "platform/gzip/linux/ZlibGunzip.h"
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/runloop/fakes/ManualRunLoop.h"
+#include "platform/runloop/linux/SystemQueues.h"
+#include "platform/web/fakes/ScriptedWebClient.h"
+
+namespace brenvik {
+
+inline std::string gzipOf(const std::string& text) {
+  z_stream stream{};
+  EXPECT_EQ(::deflateInit2(&stream, 6, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY), Z_OK);
+  std::string result(::deflateBound(&stream, text.size()) + 64, '\0');
+  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
+  stream.avail_in = static_cast<uInt>(text.size());
+  stream.next_out = reinterpret_cast<Bytef*>(result.data());
+  stream.avail_out = static_cast<uInt>(result.size());
+  EXPECT_EQ(::deflate(&stream, Z_FINISH), Z_STREAM_END);
+  result.resize(stream.total_out);
+  ::deflateEnd(&stream);
+  return result;
+}
+
+inline std::string contentOf(const std::filesystem::path& path) {
+  std::ifstream file(path, std::ios::binary);
+  return {std::istreambuf_iterator<char>(file), {}};
+}
+
+// Real queues, but for the updater's, which runs when the test says so: fetches block it, and their answers
+// come on threads of their own.
+class LasdTestQueues final : public WorkQueues {
+ public:
+  WorkQueue& main() noexcept override { return system_.main(); }
+  WorkQueue& global() noexcept override { return system_.global(); }
+  std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
+    made.emplace_back(label, qualityOfService);
+    if (label != "LASDUpdater") return system_.makeSerial(std::move(label), qualityOfService);
+    updater = std::make_shared<ManualWorkQueue>(clock_, std::move(label), qualityOfService);
+    return updater;
+  }
+  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t startTime,
+                                                           WorkQueue::Task onExit,
+                                                           WorkQueue::Task onCancel) override {
+    return system_.makeProcessExitSource(pid, startTime, std::move(onExit), std::move(onCancel));
+  }
+
+  std::vector<std::pair<std::string, QualityOfService>> made;
+  std::shared_ptr<ManualWorkQueue> updater;
+
+ private:
+  ManualClock clock_;
+  std::unique_ptr<SystemRunLoop> loop_ = SystemRunLoop::make();
+  SystemQueues system_{*loop_};
+};
+
+class LasdTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    std::string pattern = testing::TempDir() + "lasdXXXXXX";
+    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
+    folder = pattern;
+  }
+  void TearDown() override {
+    if (!folder.empty()) std::filesystem::remove_all(folder);
+  }
+  HttpFetcher::Parts fetcherParts(std::uint64_t diskReserve = 0) {
+    return {queues, web, gunzip, diskReserve};
+  }
+  void serveGzip(const std::string& url, const std::string& content) {
+    web.answer(url, 200, gzipOf(content), {{"Content-Type", "application/gzip"}});
+  }
+  static RecordingLog::Entry info(std::string line) {
+    return RecordingLog::unifiedLine(LogLevel::info, std::move(line));
+  }
+  static RecordingLog::Entry error(std::string line) {
+    return RecordingLog::unifiedLine(LogLevel::error, std::move(line));
+  }
+  using Lines = std::vector<RecordingLog::Entry>;
+
+  LasdTestQueues queues;
+  ScriptedWebClient web;
+  ZlibGunzip gunzip;
+  RecordingLog log;
+  std::filesystem::path folder;
+};
+
+}  // namespace brenvik

@@ -1,0 +1,63 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "helper/lasd/VersionText.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+namespace brenvik {
+namespace {
+
+struct Case {
+  const char* left;
+  const char* right;
+  bool same;
+};
+
+TEST(VersionTextTest, VersionsCompareByTheTable) {
+  const std::string huge(5000, '9');
+  const Case cases[] = {
+      {"", "", true},
+      {"2.0", "2.00", true},
+      {"2.0", "2", false},
+      {"2.0", "2.0.0", false},
+      {"ABC", "abc", true},
+      {"1.10", "1.1", false},
+      {"1.010", "1.10", true},
+      {"007", "7", true},
+      {"0", "000", true},
+      {"0", "", false},
+      {"1a2b", "01A002B", true},
+      {"1a2b", "1a2c", false},
+      {"10", "9", false},
+      {"v2", "V02", true},
+      {"2-beta", "2-BETA", true},
+      {"2", "2 ", false},
+      {"12", "1.2", false},
+      {"a1", "a", false},
+      {"\xC3\x89t\xC3\xA9", "\xC3\xA9T\xC3\x89", true},  // E and e with acute accent
+      {"\xC3\xA9", "e", false},
+      {"\xD0\x96", "\xD0\xB6", true},  // Cyrillic zhe
+      {"\xCE\xA3", "\xCF\x83", true},  // Greek sigma
+      {"\xEF\xBC\x91", "1", false},    // a full-width one is no ASCII digit
+      {"\xF0\x9D\x9F\x8F", "1", false},
+      {"\xC3", "\xC3", true},  // cut characters compare as their bytes
+      {"\xC3", "\xC4", false},
+      {huge.c_str(), huge.c_str(), true},
+  };
+  for (const auto& [left, right, same] : cases) {
+    EXPECT_EQ(sameVersion(left, right), same) << left << " | " << right;
+    EXPECT_EQ(sameVersion(right, left), same) << right << " | " << left;
+  }
+  EXPECT_FALSE(sameVersion(huge, huge + "0"));
+  EXPECT_TRUE(sameVersion("000" + huge, huge)) << "no value is too large";
+}
+
+TEST(VersionTextTest, ANulIsACharacterLikeOthers) {
+  EXPECT_FALSE(sameVersion(std::string("1\0a", 3), std::string("1\0b", 3)));
+  EXPECT_TRUE(sameVersion(std::string("1\0a", 3), std::string("01\0A", 4)));
+}
+
+}  // namespace
+}  // namespace brenvik

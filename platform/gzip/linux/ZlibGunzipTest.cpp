@@ -1,0 +1,123 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/gzip/linux/ZlibGunzip.h"
+
+#include <gtest/gtest.h>
+#include <zlib.h>
+
+#include <limits>
+#include <string>
+#include <vector>
+
+namespace brenvik {
+namespace {
+
+constexpr std::uint64_t kNoLimit = std::numeric_limits<std::uint64_t>::max();
+
+std::string gzip(const std::string& text) {
+  z_stream stream{};
+  EXPECT_EQ(::deflateInit2(&stream, 6, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY), Z_OK);
+  std::string result(::deflateBound(&stream, text.size()) + 64, '\0');
+  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
+  stream.avail_in = static_cast<uInt>(text.size());
+  stream.next_out = reinterpret_cast<Bytef*>(result.data());
+  stream.avail_out = static_cast<uInt>(result.size());
+  EXPECT_EQ(::deflate(&stream, Z_FINISH), Z_STREAM_END);
+  result.resize(stream.total_out);
+  ::deflateEnd(&stream);
+  return result;
+}
+
+// Text that compresses, but not to nothing.
+std::string text(std::size_t size) {
+  std::string result;
+  result.reserve(size);
+  unsigned state = 1;
+  while (result.size() < size) {
+    state = state * 1664525 + 1013904223;
+    result += static_cast<char>('a' + (state >> 28));
+  }
+  return result;
+}
+
+class ZlibGunzipTest : public testing::Test {
+ protected:
+  GunzipResult run(const std::string& input, std::uint64_t largest = kNoLimit) {
+    output.clear();
+    return gunzip.gunzip({reinterpret_cast<const std::byte*>(input.data()), input.size()}, largest,
+                         [this](std::span<const std::byte> piece) {
+                           if (output.size() + piece.size() > refuseBeyond) return false;
+                           output.append(reinterpret_cast<const char*>(piece.data()), piece.size());
+                           return true;
+                         });
+  }
+  ZlibGunzip gunzip;
+  std::string output;
+  std::size_t refuseBeyond = std::numeric_limits<std::size_t>::max();
+};
+
+TEST_F(ZlibGunzipTest, AFileOfOneMemberComesOutWhole) {
+  for (const std::size_t size : {0U, 1U, 1000U, 262'143U, 262'144U, 262'145U, 1'000'000U}) {
+    const std::string original = text(size);
+    EXPECT_EQ(run(gzip(original)), GunzipResult::whole) << size;
+    EXPECT_EQ(output, original) << size;
+  }
+}
+
+TEST_F(ZlibGunzipTest, AllMembersComeOutOneAfterTheOther) {
+  EXPECT_EQ(run(gzip("one ") + gzip("") + gzip(text(300'000)) + gzip(" four")), GunzipResult::whole);
+  EXPECT_EQ(output, "one " + text(300'000) + " four");
+}
+
+TEST_F(ZlibGunzipTest, EveryShorterLengthIsTruncated) {
+  const std::string whole = gzip("first") + gzip(text(5000));
+  const std::size_t boundary = gzip("first").size();
+  for (std::size_t size = 0; size < whole.size(); ++size) {
+    EXPECT_EQ(run(whole.substr(0, size)), size == boundary ? GunzipResult::whole : GunzipResult::truncated)
+        << size;
+  }
+}
+
+TEST_F(ZlibGunzipTest, BytesAfterTheLastMemberAreDamage) {
+  const std::string good = gzip("good");
+  EXPECT_EQ(run(good + "x"), GunzipResult::truncated) << "too short to tell from a cut header";
+  EXPECT_EQ(run(good + "trailing"), GunzipResult::damaged);
+  EXPECT_EQ(run(good + std::string(512, '\0')), GunzipResult::damaged);
+}
+
+TEST_F(ZlibGunzipTest, NoFlippedBitGoesUnnoticed) {
+  const std::string original = text(2000);
+  const std::string good = gzip(original);
+  for (std::size_t i = 0; i < good.size(); ++i) {
+    for (int bit = 0; bit < 8; ++bit) {
+      std::string bad = good;
+      bad[i] = static_cast<char>(bad[i] ^ (1 << bit));
+      const auto result = run(bad);
+      // The header's time, flags of no effect and system carry no checksum; the content is then right.
+      EXPECT_TRUE(result != GunzipResult::whole || output == original) << i << "." << bit;
+    }
+  }
+}
+
+TEST_F(ZlibGunzipTest, WhatIsNotGzipIsDamaged) {
+  EXPECT_EQ(run(std::string(4096, 'x')), GunzipResult::damaged);
+  EXPECT_EQ(run("<html>please log in</html>"), GunzipResult::damaged);
+}
+
+TEST_F(ZlibGunzipTest, OutputStopsAtTheLimitOverAllMembers) {
+  const std::string bomb = gzip(std::string(50'000'000, '\0'));
+  EXPECT_EQ(run(bomb, 49'999'999), GunzipResult::tooLarge);
+  EXPECT_LE(output.size(), 49'999'999U);
+  EXPECT_EQ(run(bomb, 50'000'000), GunzipResult::whole);
+  EXPECT_EQ(run(gzip("12345") + gzip("67890"), 9), GunzipResult::tooLarge);
+  EXPECT_EQ(run(gzip("12345") + gzip("67890"), 10), GunzipResult::whole);
+  EXPECT_EQ(run(gzip("1"), 0), GunzipResult::tooLarge);
+}
+
+TEST_F(ZlibGunzipTest, AReceiverThatSaysNoEndsTheWork) {
+  refuseBeyond = 600'000;
+  EXPECT_EQ(run(gzip(text(1'000'000))), GunzipResult::refused);
+}
+
+}  // namespace
+}  // namespace brenvik

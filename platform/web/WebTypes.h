@@ -1,0 +1,59 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <map>
+#include <string>
+#include <string_view>
+#include <vector>
+
+// The vocabulary of the HTTP client. RFC 9110.
+namespace brenvik {
+
+// Orders header names without regard to the case of ASCII letters.
+struct HeaderNameLess {
+  using is_transparent = void;
+  bool operator()(std::string_view left, std::string_view right) const noexcept;
+};
+
+// Header fields by name. Of a field that a response repeats, the values stand joined by ", ".
+using HeaderMap = std::map<std::string, std::string, HeaderNameLess>;
+
+enum class WebRequestType : std::int32_t { get = 0 };
+
+// What became of a transfer. `none`, the value 1, says that a whole response came, whatever its status.
+enum class WebErrorKind : std::int32_t {
+  unknown = 0,
+  none = 1,
+  clientUnavailable = 2,   // the HTTP client could not be loaded or started
+  cancelled = 3,           // the client was destroyed first
+  hostNotFound = 4,        // the name was looked up and has no address, or no name server answered
+  cannotConnect = 5,       // refused, unreachable
+  cellularNotAllowed = 6,  // the way there is cellular only, and the session does not allow it
+  timedOut = 7,            // connecting, stalling or the request's own limit
+  connectionLost = 8,      // ended or reset before the response was whole
+  certificateRefused = 9,  // not trusted, or made out to another name
+  certificateClock = 10,   // not valid yet or any more: the system clock may be wrong
+  secureConnection = 11,   // any other failure of TLS
+  redirectRefused = 12,    // to something other than https
+  tooManyRedirects = 13,
+  bodyTooLarge = 14,
+  malformedResponse = 15,  // not HTTP, or content that does not decode
+  outOfMemory = 16,
+};
+
+// A response, or what is known of a transfer that failed.
+struct WebResponse {
+  WebErrorKind errorKind = WebErrorKind::unknown;
+  int statusCode = 0;  // 0: none came
+  std::vector<std::byte> body;
+  HeaderMap headers;
+};
+
+// Names for people, in a log line. Never null; valid for ever.
+const char* textOfErrorKind(WebErrorKind kind) noexcept;
+const char* textOfStatusCode(int statusCode) noexcept;
+
+}  // namespace brenvik

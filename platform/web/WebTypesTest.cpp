@@ -1,0 +1,62 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/web/WebTypes.h"
+
+#include <gtest/gtest.h>
+
+#include <set>
+
+namespace brenvik {
+namespace {
+
+TEST(WebTypesTest, HeadersAreFoundWhateverTheCaseOfTheirNames) {
+  HeaderMap headers{{"Content-Type", "application/gzip"}};
+  EXPECT_EQ(headers.find("content-TYPE")->second, "application/gzip");
+  EXPECT_EQ(headers.find("Content_Type"), headers.end());
+  headers["CONTENT-TYPE"] = "text/plain";
+  EXPECT_EQ(headers.size(), 1U);
+}
+
+TEST(WebTypesTest, HeaderNamesAreOrderedAndBytesAboveAsciiCompareAsTheyAre) {
+  const HeaderNameLess less;
+  EXPECT_TRUE(less("accept", "Content-Type"));
+  EXPECT_FALSE(less("Content-Type", "accept"));
+  EXPECT_TRUE(less("Accept", "accept-encoding"));
+  EXPECT_TRUE(less("z", "\xC3\x89"));
+  EXPECT_NE(less("\xC3\x89", "\xC3\xA9"), less("\xC3\xA9", "\xC3\x89"));
+}
+
+TEST(WebTypesTest, SuccessIsTheValueOneAndGetTheValueZero) {
+  EXPECT_EQ(static_cast<int>(WebErrorKind::none), 1);
+  EXPECT_EQ(static_cast<int>(WebRequestType::get), 0);
+}
+
+TEST(WebTypesTest, EveryErrorKindHasAnOwnTextAndAStrayValueAText) {
+  std::set<std::string> texts;
+  for (int kind = 0; kind <= static_cast<int>(WebErrorKind::outOfMemory); ++kind) {
+    texts.insert(textOfErrorKind(static_cast<WebErrorKind>(kind)));
+  }
+  EXPECT_EQ(texts.size(), 17U);
+  EXPECT_STREQ(textOfErrorKind(static_cast<WebErrorKind>(99)), "unknown error");
+}
+
+TEST(WebTypesTest, AWrongClockIsSaidInWords) {
+  EXPECT_STREQ(textOfErrorKind(WebErrorKind::certificateClock),
+               "server certificate not valid at this time, check the system clock");
+}
+
+TEST(WebTypesTest, StatusCodesHaveTheirNamesAndUnlistedOnesTheirClass) {
+  EXPECT_STREQ(textOfStatusCode(200), "OK");
+  EXPECT_STREQ(textOfStatusCode(304), "Not Modified");
+  EXPECT_STREQ(textOfStatusCode(404), "Not Found");
+  EXPECT_STREQ(textOfStatusCode(0), "no status");
+  EXPECT_STREQ(textOfStatusCode(102), "Informational");
+  EXPECT_STREQ(textOfStatusCode(226), "Successful");
+  EXPECT_STREQ(textOfStatusCode(399), "Redirection");
+  EXPECT_STREQ(textOfStatusCode(418), "Client Error");
+  EXPECT_STREQ(textOfStatusCode(599), "Server Error");
+  EXPECT_STREQ(textOfStatusCode(999), "unknown status");
+}
+
+}  // namespace
+}  // namespace brenvik

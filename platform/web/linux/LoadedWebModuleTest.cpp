@@ -1,0 +1,99 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/web/linux/LoadedWebModule.h"
+
+#include <gtest/gtest.h>
+
+#include <future>
+
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/runloop/linux/SystemQueues.h"
+
+namespace brenvik {
+namespace {
+
+// One member, "hello", as gzip(1) writes it.
+constexpr unsigned char kHello[] = {0x1f, 0x8b, 0x08, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00,
+                                    0x03, 0xcb, 0x48, 0xcd, 0xc9, 0xc9, 0x07, 0x00, 0x86,
+                                    0xa6, 0x10, 0x36, 0x05, 0x00, 0x00, 0x00};
+
+class LoadedWebModuleTest : public testing::Test {
+ protected:
+  std::shared_ptr<WebResponse> fetch(LoadedWebModule& module, const std::string& url) {
+    std::promise<std::shared_ptr<WebResponse>> answer;
+    const auto session = module.webClient().makeSession();
+    session->setCellularAllowed(false);
+    const auto request = module.webClient().makeRequest(WebRequestType::get, url, {}, session);
+    EXPECT_NE(request, nullptr);
+    request->setCallbackQueue(callbackQueue);
+    request->setTimeLimit(std::chrono::seconds(10));
+    request->setLargestBody(1000);
+    request->setCompletion(
+        [&](std::shared_ptr<WebResponse> response) { answer.set_value(std::move(response)); });
+    request->send({});
+    return answer.get_future().get();
+  }
+  GunzipResult unpackHello(LoadedWebModule& module) {
+    unpacked.clear();
+    return module.gunzip().gunzip(
+        std::as_bytes(std::span(kHello)), 100, [this](std::span<const std::byte> piece) {
+          unpacked.append(reinterpret_cast<const char*>(piece.data()), piece.size());
+          return true;
+        });
+  }
+
+  std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
+  SystemQueues queues{*loop};
+  std::shared_ptr<WorkQueue> callbackQueue = queues.makeSerial("callbacks", QualityOfService::standard);
+  RecordingLog log;
+  std::string unpacked;
+};
+
+TEST_F(LoadedWebModuleTest, TheBuiltModuleGivesTheClientAndGunzip) {
+  LoadedWebModule module(queues, {BRENVIK_TEST_MODULE});
+  // Port 1 of this machine: nobody listens there, and no packet leaves.
+  EXPECT_EQ(fetch(module, "https://127.0.0.1:1/")->errorKind, WebErrorKind::cannotConnect);
+  EXPECT_EQ(unpackHello(module), GunzipResult::whole);
+  EXPECT_EQ(unpacked, "hello");
+  EXPECT_EQ(
+      module.webClient().makeRequest(WebRequestType::get, "http://x/", {}, module.webClient().makeSession()),
+      nullptr);
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(LoadedWebModuleTest, WithoutTheModuleRequestsCompleteAsUnavailableAndThatIsLoggedOnce) {
+  LoadedWebModule module(queues, {"/nonexistent/first.so", "/nonexistent/second.so"});
+  EXPECT_TRUE(log.entries().empty()) << "not looked for before it is needed";
+  EXPECT_EQ(fetch(module, "https://127.0.0.1:1/")->errorKind, WebErrorKind::clientUnavailable);
+  EXPECT_EQ(fetch(module, "https://127.0.0.1:1/")->errorKind, WebErrorKind::clientUnavailable);
+  EXPECT_EQ(unpackHello(module), GunzipResult::unavailable);
+  ASSERT_EQ(log.entries().size(), 1U);
+  EXPECT_EQ(log.entries()[0].level, static_cast<int>(LogLevel::error));
+  EXPECT_NE(log.entries()[0].line.find("/nonexistent/first.so"), std::string::npos) << log.entries()[0].line;
+}
+
+TEST_F(LoadedWebModuleTest, AFileThatIsNoModuleIsPassedOver) {
+  LoadedWebModule module(queues, {"/proc/self/exe", "/etc/passwd", BRENVIK_TEST_MODULE});
+  EXPECT_EQ(fetch(module, "https://127.0.0.1:1/")->errorKind, WebErrorKind::cannotConnect);
+}
+
+TEST_F(LoadedWebModuleTest, AfterShuttingDownRequestsCompleteAsCancelled) {
+  LoadedWebModule module(queues, {BRENVIK_TEST_MODULE});
+  EXPECT_EQ(fetch(module, "https://127.0.0.1:1/")->errorKind, WebErrorKind::cannotConnect);
+  module.shutDown();
+  EXPECT_EQ(fetch(module, "https://127.0.0.1:1/")->errorKind, WebErrorKind::cancelled);
+  LoadedWebModule unused(queues, {BRENVIK_TEST_MODULE});
+  unused.shutDown();
+  EXPECT_EQ(fetch(unused, "https://127.0.0.1:1/")->errorKind, WebErrorKind::cancelled);
+}
+
+TEST_F(LoadedWebModuleTest, TheModuleIsLookedForBesideTheProgramFirst) {
+  const auto places = webModulePlaces();
+  ASSERT_EQ(places.size(), 2U);
+  EXPECT_TRUE(places[0].starts_with('/'));
+  EXPECT_TRUE(places[0].ends_with("/unit/brenvik-web.so")) << places[0];
+  EXPECT_TRUE(places[1].ends_with("/brenvik/brenvik-web.so")) << places[1];
+}
+
+}  // namespace
+}  // namespace brenvik

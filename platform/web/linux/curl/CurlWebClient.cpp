@@ -1,0 +1,613 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/web/linux/curl/CurlWebClient.h"
+
+#include <arpa/inet.h>
+#include <curl/curl.h>
+#include <netinet/in.h>
+#include <strings.h>
+#include <sys/epoll.h>
+#include <sys/socket.h>
+
+#include <algorithm>
+#include <future>
+#include <map>
+#include <mutex>
+#include <new>
+#include <optional>
+#include <string_view>
+#include <utility>
+
+#include "platform/base/UniqueFd.h"
+
+namespace brenvik {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+using std::chrono::milliseconds;
+
+constexpr const char kQueueLabel[] = "HTTP client";
+// Below this rate for the whole of the stall limit, a transfer is given up.
+constexpr long kStallBytesPerSecond = 200;
+constexpr int kMostRedirects = 10;
+// Of all header lines of one response; a sane server stays far below.
+constexpr std::size_t kLargestHeaders = std::size_t{256} * 1024;
+constexpr long kReceiveBufferSize = 256L * 1024;
+// Wake-ups for time-outs may be put off by this much.
+constexpr auto kTimerLeeway = milliseconds(1);
+// Of the TLS library, which libcurl gives out as they are; see x509_vfy.h.
+constexpr long kCertificateNotYetValid = 9;
+constexpr long kCertificateExpired = 10;
+
+// Both handles are void to the compiler, so their owners must say what they are.
+struct EasyCleanup {
+  void operator()(CURL* easy) const noexcept { curl_easy_cleanup(easy); }
+};
+struct MultiCleanup {
+  void operator()(CURLM* multi) const noexcept { (void)curl_multi_cleanup(multi); }
+};
+struct UrlCleanup {
+  void operator()(CURLU* url) const noexcept { curl_url_cleanup(url); }
+};
+struct ListCleanup {
+  void operator()(curl_slist* list) const noexcept { curl_slist_free_all(list); }
+};
+struct TextCleanup {
+  void operator()(char* text) const noexcept { curl_free(text); }
+};
+using Easy = std::unique_ptr<CURL, EasyCleanup>;
+using Multi = std::unique_ptr<CURLM, MultiCleanup>;
+using Url = std::unique_ptr<CURLU, UrlCleanup>;
+using List = std::unique_ptr<curl_slist, ListCleanup>;
+using Text = std::unique_ptr<char, TextCleanup>;
+
+// Once a process and never undone: other parts may use the library too.
+bool startLibrary() noexcept {
+  static const bool started = curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
+  return started;
+}
+
+std::string partOf(CURLU* url, CURLUPart part) {
+  char* value = nullptr;
+  if (curl_url_get(url, part, &value, 0) != CURLUE_OK) return {};
+  const Text owned(value);
+  return value;
+}
+
+struct ParsedUrl {
+  std::string scheme;  // lower case
+  std::string host;    // without the brackets of an IPv6 address
+};
+
+// Nothing when the text is no URL: blanks and control characters in it included.
+std::optional<ParsedUrl> parseUrl(const std::string& text) {
+  if (text.find('\0') != std::string::npos) return std::nullopt;
+  const Url url(curl_url());
+  if (url == nullptr || curl_url_set(url.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK)
+    return std::nullopt;
+  ParsedUrl parsed{partOf(url.get(), CURLUPART_SCHEME), partOf(url.get(), CURLUPART_HOST)};
+  if (parsed.host.starts_with('[') && parsed.host.ends_with(']')) {
+    parsed.host = parsed.host.substr(1, parsed.host.size() - 2);
+  }
+  if (parsed.host.empty()) return std::nullopt;
+  return parsed;
+}
+
+// Addresses are not looked up, nor is this machine's own name, which libcurl knows by itself.
+bool needsLookUp(const std::string& host) {
+  in6_addr space{};
+  if (::inet_pton(AF_INET, host.c_str(), &space) == 1 || ::inet_pton(AF_INET6, host.c_str(), &space) == 1)
+    return false;
+  constexpr std::string_view kLocal = "localhost";
+  if (host.size() < kLocal.size()) return true;
+  const std::size_t before = host.size() - kLocal.size();
+  return ::strcasecmp(host.c_str() + before, kLocal.data()) != 0 || (before > 0 && host[before - 1] != '.');
+}
+
+std::string_view trimmed(std::string_view text) noexcept {
+  constexpr std::string_view kBlanks = " \t\r\n";
+  const auto first = text.find_first_not_of(kBlanks);
+  if (first == std::string_view::npos) return {};
+  return text.substr(first, text.find_last_not_of(kBlanks) - first + 1);
+}
+
+bool isRedirect(long status) noexcept {
+  return status == 301 || status == 302 || status == 303 || status == 307 || status == 308;
+}
+
+bool breaksLines(const std::string& text) noexcept {
+  return text.find_first_of(std::string_view("\r\n\0", 3)) != std::string::npos;
+}
+
+}  // namespace
+
+class CurlWebClient::Session final : public WebSession {
+ public:
+  void setCellularAllowed(bool allowed) noexcept override { cellularAllowed = allowed; }
+  bool cellularAllowed = true;
+};
+
+// One request on its way. Set up by the request; from submit() on the driver's, on its queue.
+struct CurlWebClient::Transfer {
+  std::string url;
+  HeaderMap headers;
+  std::shared_ptr<Session> session;
+  std::shared_ptr<WorkQueue> callbackQueue;
+  WebRequest::Completion completion;
+  milliseconds timeLimit{0};
+  std::uint64_t largestBody = kLargestWebBody;
+
+  const CurlSettings* settings = nullptr;
+  bool cellularAllowed = true;
+  Clock::time_point deadline = Clock::time_point::max();
+  int redirects = 0;
+  std::shared_ptr<WebResponse> response = std::make_shared<WebResponse>();
+  // Of the present attempt:
+  List headerList;
+  Easy easy;
+  std::size_t headerBytes = 0;
+  bool bodyBegun = false;
+  bool wayWasCellular = false;
+  std::optional<WebErrorKind> ownVerdict;  // why one of our callbacks stopped it
+
+  // Tells the outcome, which may be done once.
+  void finish(WebErrorKind kind) {
+    response->errorKind = kind;
+    if (kind != WebErrorKind::none) response->body = {};
+    if (callbackQueue == nullptr || !completion) return;
+    callbackQueue->post([done = std::move(completion), answer = std::move(response)] { done(answer); });
+    callbackQueue.reset();
+  }
+
+  static std::size_t onHeader(char* data, std::size_t, std::size_t size, void* self) noexcept;
+  static std::size_t onBody(char* data, std::size_t, std::size_t size, void* self) noexcept;
+  static curl_socket_t onOpenSocket(void* self, curlsocktype purpose, curl_sockaddr* address) noexcept;
+};
+
+std::size_t CurlWebClient::Transfer::onHeader(char* data, std::size_t, std::size_t size,
+                                              void* self) noexcept {
+  auto& transfer = *static_cast<Transfer*>(self);
+  try {
+    const std::string_view line(data, size);
+    transfer.headerBytes += size;
+    if (transfer.headerBytes > kLargestHeaders) {
+      transfer.ownVerdict = WebErrorKind::malformedResponse;
+      return 0;
+    }
+    HeaderMap& headers = transfer.response->headers;
+    if (line.starts_with("HTTP/")) headers.clear();  // of an interim response before this one
+    if (transfer.bodyBegun) return size;             // trailer fields are not header fields
+    const auto colon = line.find(':');
+    if (colon == std::string_view::npos || colon == 0) return size;
+    const auto value = trimmed(line.substr(colon + 1));
+    const auto [at, isNew] = headers.try_emplace(std::string(trimmed(line.substr(0, colon))), value);
+    if (!isNew) at->second.append(", ").append(value);
+    return size;
+  } catch (...) {
+    transfer.ownVerdict = WebErrorKind::outOfMemory;
+    return 0;
+  }
+}
+
+std::size_t CurlWebClient::Transfer::onBody(char* data, std::size_t, std::size_t size, void* self) noexcept {
+  auto& transfer = *static_cast<Transfer*>(self);
+  auto& body = transfer.response->body;
+  if (size > transfer.largestBody - body.size()) {
+    transfer.ownVerdict = WebErrorKind::bodyTooLarge;
+    return 0;
+  }
+  try {
+    if (!std::exchange(transfer.bodyBegun, true)) {
+      curl_off_t announced = 0;
+      if (curl_easy_getinfo(transfer.easy.get(), CURLINFO_CONTENT_LENGTH_DOWNLOAD_T, &announced) ==
+              CURLE_OK &&
+          announced > 0) {
+        body.reserve(std::min<std::uint64_t>(static_cast<std::uint64_t>(announced), transfer.largestBody));
+      }
+    }
+    const auto* bytes = reinterpret_cast<const std::byte*>(data);
+    body.insert(body.end(), bytes, bytes + size);
+    return size;
+  } catch (...) {
+    transfer.ownVerdict = WebErrorKind::outOfMemory;
+    return 0;
+  }
+}
+
+// Here, and not with the request's options, because only here the address is known; binding the socket keeps
+// the answer true when routes change. CURLOPT_INTERFACE would bind it anew afterwards and undo this.
+curl_socket_t CurlWebClient::Transfer::onOpenSocket(void* self, curlsocktype,
+                                                    curl_sockaddr* address) noexcept {
+  auto& transfer = *static_cast<Transfer*>(self);
+  UniqueFd fd(::socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol));
+  if (!fd.isValid()) return CURL_SOCKET_BAD;
+  if (!transfer.cellularAllowed) {
+    const ConnectionWay way = wayTowards(address->addr, transfer.settings->cellularFiles);
+    if (way.kind == ConnectionWay::Kind::cellular) transfer.wayWasCellular = true;
+    if (way.kind != ConnectionWay::Kind::open) return CURL_SOCKET_BAD;
+    if (::setsockopt(fd.get(), SOL_SOCKET, SO_BINDTODEVICE, way.interfaceName.c_str(),
+                     static_cast<socklen_t>(way.interfaceName.size() + 1)) != 0) {
+      return CURL_SOCKET_BAD;
+    }
+  }
+  return fd.release();
+}
+
+// Drives libcurl's multi interface from one queue.
+class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
+ public:
+  Driver(std::shared_ptr<WorkQueue> queue, CurlSettings settings)
+      : settings_(std::move(settings)), loop_(queue.get()), queue_(std::move(queue)) {}
+
+  // Any thread.
+  void submit(std::shared_ptr<Transfer> transfer) {
+    transfer->settings = &settings_;
+    transfer->cellularAllowed = transfer->session == nullptr || transfer->session->cellularAllowed;
+    if (transfer->timeLimit > milliseconds::zero()) transfer->deadline = Clock::now() + transfer->timeLimit;
+    {
+      const std::lock_guard lock(mutex_);
+      if (!closed_) {
+        queue_->post([self = shared_from_this(), transfer] { self->start(transfer); });
+        return;
+      }
+    }
+    transfer->finish(WebErrorKind::cancelled);
+  }
+
+  // Completes what is under way as cancelled and ends the queue. Not on the queue.
+  void shutDown() noexcept {
+    std::shared_ptr<WorkQueue> queue;
+    {
+      const std::lock_guard lock(mutex_);
+      closed_ = true;
+      queue = std::move(queue_);
+    }
+    if (queue == nullptr) return;
+    if (queue->isCurrent()) {
+      abandonAll();
+      return;
+    }
+    std::promise<void> abandoned;
+    queue->post([this, &abandoned] {
+      abandonAll();
+      abandoned.set_value();
+    });
+    abandoned.get_future().wait();
+  }
+
+ private:
+  // ---- all below: on the queue ----
+
+  void start(const std::shared_ptr<Transfer>& transfer) {
+    try {
+      if (multi_ == nullptr && !makeMulti()) return transfer->finish(WebErrorKind::outOfMemory);
+      attempt(transfer);
+    } catch (...) {
+      transfer->finish(WebErrorKind::outOfMemory);
+    }
+  }
+
+  bool makeMulti() {
+    multi_.reset(curl_multi_init());
+    if (multi_ == nullptr) return false;
+    curl_multi_setopt(multi_.get(), CURLMOPT_SOCKETFUNCTION, &Driver::onSocket);
+    curl_multi_setopt(multi_.get(), CURLMOPT_SOCKETDATA, this);
+    curl_multi_setopt(multi_.get(), CURLMOPT_TIMERFUNCTION, &Driver::onTimer);
+    curl_multi_setopt(multi_.get(), CURLMOPT_TIMERDATA, this);
+    return true;
+  }
+
+  // Sends the request to the transfer's present URL.
+  void attempt(const std::shared_ptr<Transfer>& transfer) {
+    const auto url = parseUrl(transfer->url);
+    if (!url)
+      return transfer->finish(WebErrorKind::malformedResponse);  // of a redirect; requests are checked
+    if (!transfer->cellularAllowed && needsLookUp(url->host) &&
+        !mayLookUpName(url->host, settings_.cellularFiles)) {
+      return transfer->finish(WebErrorKind::cellularNotAllowed);
+    }
+    milliseconds left{0};
+    if (transfer->deadline != Clock::time_point::max()) {
+      left = std::chrono::ceil<milliseconds>(transfer->deadline - Clock::now());
+      if (left <= milliseconds::zero()) return transfer->finish(WebErrorKind::timedOut);
+    }
+
+    transfer->response->headers.clear();
+    transfer->response->body.clear();
+    transfer->headerBytes = 0;
+    transfer->bodyBegun = false;
+    transfer->wayWasCellular = false;
+    transfer->ownVerdict.reset();
+    transfer->easy.reset(curl_easy_init());
+    if (transfer->easy == nullptr || !setUp(*transfer, left))
+      return transfer->finish(WebErrorKind::outOfMemory);
+    active_.emplace(transfer->easy.get(), transfer);
+    if (curl_multi_add_handle(multi_.get(), transfer->easy.get()) != CURLM_OK) {
+      active_.erase(transfer->easy.get());
+      transfer->easy.reset();
+      transfer->finish(WebErrorKind::outOfMemory);
+    }
+  }
+
+  bool setUp(Transfer& transfer, milliseconds left) {
+    CURL* const easy = transfer.easy.get();
+    List list;
+    std::string acceptEncoding;
+    for (const auto& [name, value] : transfer.headers) {
+      if (breaksLines(name) || breaksLines(value) || name.empty()) continue;
+      if (::strcasecmp(name.c_str(), "Accept-Encoding") == 0) {
+        acceptEncoding = value;
+        continue;
+      }
+      curl_slist* const longer = curl_slist_append(list.get(), (name + ": " + value).c_str());
+      if (longer == nullptr) return false;
+      (void)list.release();
+      list.reset(longer);
+    }
+    transfer.headerList = std::move(list);
+
+    bool ok = true;
+    const auto set = [&](CURLoption option, auto value) {
+      ok &= curl_easy_setopt(easy, option, value) == CURLE_OK;
+    };
+    set(CURLOPT_URL, transfer.url.c_str());
+    set(CURLOPT_HTTPHEADER, transfer.headerList.get());
+    if (!acceptEncoding.empty()) set(CURLOPT_ACCEPT_ENCODING, acceptEncoding.c_str());
+    set(CURLOPT_NOSIGNAL, 1L);
+    set(CURLOPT_PROTOCOLS_STR, "https");
+    set(CURLOPT_FOLLOWLOCATION, 0L);  // followed here, so that each name passes the rule on look-ups
+    set(CURLOPT_PROXY, "");           // none, whatever the environment says
+    set(CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_2));
+    set(CURLOPT_SSL_VERIFYPEER, 1L);
+    set(CURLOPT_SSL_VERIFYHOST, 2L);
+    if (!settings_.certificateAuthorities.empty()) {
+      set(CURLOPT_CAINFO, settings_.certificateAuthorities.c_str());
+      set(CURLOPT_CAPATH, static_cast<const char*>(nullptr));
+    }
+    // One transfer, one connection: a connection that another session opened may be a cellular one.
+    set(CURLOPT_FRESH_CONNECT, 1L);
+    set(CURLOPT_FORBID_REUSE, 1L);
+    set(CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_1_1));
+    set(CURLOPT_CONNECTTIMEOUT_MS, static_cast<long>(settings_.connectLimit.count()));
+    if (left > milliseconds::zero()) set(CURLOPT_TIMEOUT_MS, static_cast<long>(left.count()));
+    set(CURLOPT_LOW_SPEED_LIMIT, kStallBytesPerSecond);
+    set(CURLOPT_LOW_SPEED_TIME, static_cast<long>(settings_.stallLimit.count()));
+    set(CURLOPT_QUICK_EXIT, 1L);  // else a dead name server outlasts every limit
+    set(CURLOPT_BUFFERSIZE, kReceiveBufferSize);
+    // What is announced is checked here, what comes in onBody().
+    set(CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(transfer.largestBody));
+    set(CURLOPT_HEADERFUNCTION, &Transfer::onHeader);
+    set(CURLOPT_HEADERDATA, &transfer);
+    set(CURLOPT_WRITEFUNCTION, &Transfer::onBody);
+    set(CURLOPT_WRITEDATA, &transfer);
+    set(CURLOPT_OPENSOCKETFUNCTION, &Transfer::onOpenSocket);
+    set(CURLOPT_OPENSOCKETDATA, &transfer);
+    return ok;
+  }
+
+  static int onSocket(CURL*, curl_socket_t fd, int what, void* self, void*) noexcept {
+    auto& driver = *static_cast<Driver*>(self);
+    try {
+      if (what == CURL_POLL_REMOVE) {
+        driver.sockets_.erase(fd);
+        return 0;
+      }
+      const std::uint32_t events = ((what & CURL_POLL_IN) != 0 ? std::uint32_t{EPOLLIN} : 0U) |
+                                   ((what & CURL_POLL_OUT) != 0 ? std::uint32_t{EPOLLOUT} : 0U);
+      auto& source = driver.sockets_[fd];
+      if (source != nullptr) return source->setEvents(events) ? 0 : -1;
+      source = driver.loop_->watchDescriptor(fd, events, [&driver, fd](std::uint32_t ready) {
+        int mask = 0;
+        if ((ready & (EPOLLIN | EPOLLHUP)) != 0) mask |= CURL_CSELECT_IN;
+        if ((ready & EPOLLOUT) != 0) mask |= CURL_CSELECT_OUT;
+        if ((ready & EPOLLERR) != 0) mask |= CURL_CSELECT_ERR;
+        driver.act(fd, mask);
+      });
+      return source != nullptr ? 0 : -1;
+    } catch (...) {
+      return -1;  // libcurl then fails its transfers
+    }
+  }
+
+  static int onTimer(CURLM*, long delay, void* self) noexcept {
+    static_cast<Driver*>(self)->setTimer(delay);
+    return 0;
+  }
+
+  // libcurl moves its time-out with nearly every piece of data. An armed timer that is too early is left
+  // alone: when it fires it finds that out, which is cheaper than arming anew each time.
+  void setTimer(long delay) noexcept {
+    if (delay < 0) {
+      due_.reset();
+      return;
+    }
+    due_ = Clock::now() + milliseconds(delay);
+    if (timer_ == nullptr || *due_ < armedFor_) arm();
+  }
+
+  void arm() noexcept {
+    armedFor_ = *due_;
+    const auto delay = std::max(Clock::duration::zero(), armedFor_ - Clock::now());
+    timer_ =
+        loop_->makeTimer(delay, std::chrono::nanoseconds::zero(), kTimerLeeway, [this] { timerFired(); });
+    if (timer_ != nullptr) timer_->activate();
+  }
+
+  void timerFired() {
+    const auto fired = std::move(timer_);
+    if (!due_) return;
+    if (Clock::now() < *due_) return arm();
+    due_.reset();
+    act(CURL_SOCKET_TIMEOUT, 0);
+    // libcurl tells of a time-out only when it has changed; one it saw as not quite due has not.
+    long delay = -1;
+    if (!due_ && multi_ != nullptr && curl_multi_timeout(multi_.get(), &delay) == CURLM_OK) setTimer(delay);
+  }
+
+  void act(curl_socket_t fd, int mask) {
+    int running = 0;
+    (void)curl_multi_socket_action(multi_.get(), fd, mask, &running);  // what failed shows in the messages
+    int left = 0;
+    while (const CURLMsg* const message = curl_multi_info_read(multi_.get(), &left)) {
+      if (message->msg != CURLMSG_DONE) continue;
+      const CURLcode code = message->data.result;
+      const auto found = active_.find(message->easy_handle);
+      if (found == active_.end()) continue;
+      const std::shared_ptr<Transfer> transfer = found->second;
+      active_.erase(found);
+      (void)curl_multi_remove_handle(multi_.get(), transfer->easy.get());
+      try {
+        ended(transfer, code);
+      } catch (...) {
+        transfer->finish(WebErrorKind::outOfMemory);
+      }
+    }
+    if (active_.empty()) {
+      due_.reset();
+      timer_.reset();
+    }
+  }
+
+  void ended(const std::shared_ptr<Transfer>& transfer, CURLcode code) {
+    long status = 0;
+    (void)curl_easy_getinfo(transfer->easy.get(), CURLINFO_RESPONSE_CODE, &status);
+    transfer->response->statusCode = static_cast<int>(status);
+    if (code == CURLE_OK && isRedirect(status)) {
+      const char* location = nullptr;
+      (void)curl_easy_getinfo(transfer->easy.get(), CURLINFO_REDIRECT_URL, &location);
+      if (location != nullptr) return follow(transfer, location);
+    }
+    const WebErrorKind kind = verdict(*transfer, code);
+    transfer->easy.reset();
+    transfer->finish(kind);
+  }
+
+  void follow(const std::shared_ptr<Transfer>& transfer, const std::string& location) {
+    const auto url = parseUrl(location);
+    if (!url || url->scheme != "https") return transfer->finish(WebErrorKind::redirectRefused);
+    if (++transfer->redirects > kMostRedirects) return transfer->finish(WebErrorKind::tooManyRedirects);
+    transfer->url = location;
+    attempt(transfer);
+  }
+
+  static WebErrorKind verdict(const Transfer& transfer, CURLcode code) {
+    if (transfer.ownVerdict && code != CURLE_OK) return *transfer.ownVerdict;
+    switch (code) {
+      case CURLE_OK:
+        return WebErrorKind::none;
+      case CURLE_COULDNT_RESOLVE_HOST:
+        return WebErrorKind::hostNotFound;
+      case CURLE_COULDNT_CONNECT:
+        return transfer.wayWasCellular ? WebErrorKind::cellularNotAllowed : WebErrorKind::cannotConnect;
+      case CURLE_OPERATION_TIMEDOUT:
+        return WebErrorKind::timedOut;
+      case CURLE_GOT_NOTHING:
+      case CURLE_SEND_ERROR:
+      case CURLE_RECV_ERROR:
+      case CURLE_PARTIAL_FILE:
+        return WebErrorKind::connectionLost;
+      case CURLE_PEER_FAILED_VERIFICATION: {
+        long reason = 0;
+        (void)curl_easy_getinfo(transfer.easy.get(), CURLINFO_SSL_VERIFYRESULT, &reason);
+        return reason == kCertificateNotYetValid || reason == kCertificateExpired
+                   ? WebErrorKind::certificateClock
+                   : WebErrorKind::certificateRefused;
+      }
+      case CURLE_SSL_CACERT_BADFILE:
+        return WebErrorKind::certificateRefused;
+      case CURLE_SSL_CONNECT_ERROR:
+      case CURLE_SSL_ENGINE_NOTFOUND:
+      case CURLE_SSL_CIPHER:
+        return WebErrorKind::secureConnection;
+      case CURLE_FILESIZE_EXCEEDED:
+        return WebErrorKind::bodyTooLarge;
+      case CURLE_BAD_CONTENT_ENCODING:
+      case CURLE_WEIRD_SERVER_REPLY:
+      case CURLE_UNSUPPORTED_PROTOCOL:
+        return WebErrorKind::malformedResponse;
+      case CURLE_OUT_OF_MEMORY:
+        return WebErrorKind::outOfMemory;
+      default:
+        return WebErrorKind::unknown;
+    }
+  }
+
+  void abandonAll() {
+    const auto abandoned = std::exchange(active_, {});
+    for (const auto& [easy, transfer] : abandoned) {
+      (void)curl_multi_remove_handle(multi_.get(), easy);
+      transfer->easy.reset();
+      transfer->finish(WebErrorKind::cancelled);
+    }
+    multi_.reset();  // while its sockets can still be taken out of the loop
+    sockets_.clear();
+    timer_.reset();
+    due_.reset();
+  }
+
+  const CurlSettings settings_;
+  WorkQueue* const loop_;  // what queue_ owns, for use on it
+  std::mutex mutex_;       // guards the next two
+  bool closed_ = false;
+  std::shared_ptr<WorkQueue> queue_;
+
+  std::map<curl_socket_t, std::unique_ptr<DescriptorSource>> sockets_;
+  std::unique_ptr<WorkQueue::Timer> timer_;
+  Clock::time_point armedFor_;
+  std::optional<Clock::time_point> due_;
+  Multi multi_;
+  std::map<CURL*, std::shared_ptr<Transfer>> active_;
+};
+
+class CurlWebClient::Request final : public WebRequest {
+ public:
+  Request(std::shared_ptr<Driver> driver, std::shared_ptr<Transfer> transfer)
+      : driver_(std::move(driver)), transfer_(std::move(transfer)) {}
+
+  void setCallbackQueue(std::shared_ptr<WorkQueue> queue) override {
+    if (transfer_ != nullptr) transfer_->callbackQueue = std::move(queue);
+  }
+  void setCompletion(Completion completion) override {
+    if (transfer_ != nullptr) transfer_->completion = std::move(completion);
+  }
+  void setTimeLimit(milliseconds limit) noexcept override {
+    if (transfer_ != nullptr) transfer_->timeLimit = limit;
+  }
+  void setLargestBody(std::uint64_t bytes) noexcept override {
+    if (transfer_ != nullptr) transfer_->largestBody = std::min(bytes, kLargestWebBody);
+  }
+  void send(std::vector<std::byte>) override {
+    if (transfer_ != nullptr) driver_->submit(std::exchange(transfer_, nullptr));
+  }
+
+ private:
+  const std::shared_ptr<Driver> driver_;
+  std::shared_ptr<Transfer> transfer_;  // until it is sent
+};
+
+CurlWebClient::CurlWebClient(std::shared_ptr<Driver> driver) : driver_(std::move(driver)) {}
+
+std::unique_ptr<CurlWebClient> CurlWebClient::make(WorkQueues& queues, CurlSettings settings) {
+  if (!startLibrary()) return nullptr;
+  auto queue = queues.makeSerial(kQueueLabel, QualityOfService::standard);
+  return std::unique_ptr<CurlWebClient>(
+      new CurlWebClient(std::make_shared<Driver>(std::move(queue), std::move(settings))));
+}
+
+CurlWebClient::~CurlWebClient() { driver_->shutDown(); }
+
+std::shared_ptr<WebSession> CurlWebClient::makeSession() { return std::make_shared<Session>(); }
+
+std::shared_ptr<WebRequest> CurlWebClient::makeRequest(WebRequestType type, const std::string& url,
+                                                       const HeaderMap& headers,
+                                                       std::shared_ptr<WebSession> session) {
+  const auto parsed = parseUrl(url);
+  if (type != WebRequestType::get || !parsed || parsed->scheme != "https") return nullptr;
+  auto transfer = std::make_shared<Transfer>();
+  transfer->url = url;
+  transfer->headers = headers;
+  transfer->session = std::static_pointer_cast<Session>(session);
+  return std::make_shared<Request>(driver_, std::move(transfer));
+}
+
+}  // namespace brenvik

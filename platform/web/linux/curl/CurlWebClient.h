@@ -1,0 +1,45 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <chrono>
+#include <memory>
+#include <string>
+
+#include "platform/net/linux/CellularRule.h"
+#include "platform/runloop/WorkQueue.h"
+#include "platform/web/WebClient.h"
+
+namespace brenvik {
+
+struct CurlSettings {
+  std::string certificateAuthorities;  // a file of trusted certificates; empty: the system's
+  std::chrono::milliseconds connectLimit = std::chrono::seconds(30);  // name, connection and TLS together
+  std::chrono::seconds stallLimit = std::chrono::seconds(30);  // two at least: rates are taken over a second
+  CellularRuleFiles cellularFiles;
+};
+
+// The HTTP client on libcurl's multi interface, driven by a queue of its own. What is under way when it is
+// destroyed completes as cancelled. Not to be destroyed on a queue it made or calls back on.
+class CurlWebClient final : public WebClient {
+ public:
+  // Null when libcurl does not start.
+  static std::unique_ptr<CurlWebClient> make(WorkQueues& queues, CurlSettings settings = {});
+  ~CurlWebClient() override;
+
+  std::shared_ptr<WebSession> makeSession() override;
+  std::shared_ptr<WebRequest> makeRequest(WebRequestType type, const std::string& url,
+                                          const HeaderMap& headers,
+                                          std::shared_ptr<WebSession> session) override;
+
+ private:
+  class Driver;
+  class Session;
+  class Request;
+  struct Transfer;
+
+  explicit CurlWebClient(std::shared_ptr<Driver> driver);
+  const std::shared_ptr<Driver> driver_;
+};
+
+}  // namespace brenvik

@@ -1,0 +1,605 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/web/linux/curl/CurlWebClient.h"
+
+#include <gtest/gtest.h>
+#include <zlib.h>
+
+#include <csignal>
+#include <filesystem>
+#include <fstream>
+#include <future>
+#include <optional>
+
+#include "platform/net/fakes/PrivateNetwork.h"
+#include "platform/runloop/linux/SystemQueues.h"
+#include "platform/web/fakes/HttpsServer.h"
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+using Connection = HttpsServer::Connection;
+
+const char kLocalNames[] = "DNS:localhost,IP:127.0.0.1";
+
+std::string gzip(const std::string& text) {
+  z_stream stream{};
+  EXPECT_EQ(::deflateInit2(&stream, 6, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY), Z_OK);
+  std::string result(::deflateBound(&stream, text.size()) + 64, '\0');
+  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
+  stream.avail_in = static_cast<uInt>(text.size());
+  stream.next_out = reinterpret_cast<Bytef*>(result.data());
+  stream.avail_out = static_cast<uInt>(result.size());
+  EXPECT_EQ(::deflate(&stream, Z_FINISH), Z_STREAM_END);
+  result.resize(stream.total_out);
+  ::deflateEnd(&stream);
+  return result;
+}
+
+std::string textOf(const WebResponse& response) {
+  return {reinterpret_cast<const char*>(response.body.data()), response.body.size()};
+}
+
+class CurlWebClientTest : public testing::Test {
+ protected:
+  CurlWebClientTest() {
+    std::signal(SIGPIPE, SIG_IGN);  // the server's TLS library writes to clients that have gone
+    std::string pattern = testing::TempDir() + "webclientXXXXXX";
+    EXPECT_NE(::mkdtemp(pattern.data()), nullptr);
+    folder = pattern;
+    settings.certificateAuthorities = folder / "authority.pem";
+    authority.writeCertificate(settings.certificateAuthorities);
+    settings.connectLimit = 10s;
+    settings.stallLimit = 10s;
+  }
+  ~CurlWebClientTest() override {
+    client.reset();
+    callbackQueue.reset();
+    std::filesystem::remove_all(folder);
+  }
+
+  void makeClient() {
+    client = CurlWebClient::make(queues, settings);
+    ASSERT_NE(client, nullptr);
+  }
+
+  struct Options {
+    HeaderMap headers = {};
+    bool cellularAllowed = true;
+    std::chrono::milliseconds timeLimit = 0ms;
+    std::uint64_t largestBody = kLargestWebBody;
+  };
+  // Sends a request; the future has its response. A second completion fails the test.
+  std::future<std::shared_ptr<WebResponse>> start(const std::string& url, const Options& options) {
+    if (client == nullptr) makeClient();
+    const auto session = client->makeSession();
+    session->setCellularAllowed(options.cellularAllowed);
+    const auto request = client->makeRequest(WebRequestType::get, url, options.headers, session);
+    auto promise = std::make_shared<std::promise<std::shared_ptr<WebResponse>>>();
+    auto future = promise->get_future();
+    if (request == nullptr) {
+      ADD_FAILURE() << "no request for " << url;
+      promise->set_value(nullptr);
+      return future;
+    }
+    request->setCallbackQueue(callbackQueue);
+    request->setTimeLimit(options.timeLimit);
+    request->setLargestBody(options.largestBody);
+    request->setCompletion(
+        [this, promise, count = std::make_shared<int>(0)](std::shared_ptr<WebResponse> response) {
+          EXPECT_TRUE(callbackQueue->isCurrent());
+          ASSERT_EQ(++*count, 1) << "completed twice";
+          promise->set_value(std::move(response));
+        });
+    request->send({});
+    request->send({});  // to no effect
+    return future;
+  }
+  std::shared_ptr<WebResponse> fetch(const std::string& url, const Options& options) {
+    auto response = start(url, options).get();
+    EXPECT_NE(response, nullptr);
+    return response != nullptr ? response : std::make_shared<WebResponse>();
+  }
+  std::shared_ptr<WebResponse> fetch(const std::string& url) { return fetch(url, Options()); }
+  void expectKind(WebErrorKind kind, const std::shared_ptr<WebResponse>& response) {
+    EXPECT_STREQ(textOfErrorKind(response->errorKind), textOfErrorKind(kind));
+    EXPECT_TRUE(kind == WebErrorKind::none || response->body.empty());
+  }
+
+  std::filesystem::path folder;
+  Identity authority;
+  Identity identity{authority, kLocalNames};
+  CurlSettings settings;
+  std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
+  SystemQueues queues{*loop};
+  std::shared_ptr<WorkQueue> callbackQueue = queues.makeSerial("callbacks", QualityOfService::standard);
+  std::unique_ptr<CurlWebClient> client;
+};
+
+// ---- what is sent and what comes back ----
+
+TEST_F(CurlWebClientTest, AResponseArrivesWholeOnTheGivenQueueExactlyOnce) {
+  const std::string big(3'000'000, 'b');
+  HttpsServer server(identity, [&](Connection& connection) {
+    connection.readRequest();
+    connection.respond(
+        "200 OK\r\nContent-Type: application/x-gzip\r\nX-One: first\r\nx-one:  second \r\nEmpty:", big);
+  });
+  const auto response = fetch(server.url());
+  expectKind(WebErrorKind::none, response);
+  EXPECT_EQ(response->statusCode, 200);
+  EXPECT_TRUE(textOf(*response) == big);
+  EXPECT_EQ(response->headers["content-type"], "application/x-gzip");
+  EXPECT_EQ(response->headers["X-ONE"], "first, second");
+  EXPECT_EQ(response->headers["Empty"], "");
+}
+
+TEST_F(CurlWebClientTest, TheRequestCarriesItsHeadersAndNothingOfOurOwnInvention) {
+  std::promise<std::string> seen;
+  HttpsServer server(identity, [&](Connection& connection) {
+    seen.set_value(connection.readRequest());
+    connection.respond("200 OK", "x");
+  });
+  Options options;
+  options.headers = {{"Accept-Encoding", "gzip"}, {"User-Agent", "tester/1"}, {"Evil", "a\r\nInjected: yes"}};
+  fetch(server.url("/1/v3/a%20b?q=1"), options);
+  const std::string request = seen.get_future().get();
+  EXPECT_TRUE(request.starts_with("GET /1/v3/a%20b?q=1 HTTP/1.1\r\n")) << request;
+  EXPECT_NE(request.find("\r\nAccept-Encoding: gzip\r\n"), std::string::npos);
+  EXPECT_NE(request.find("\r\nUser-Agent: tester/1\r\n"), std::string::npos);
+  EXPECT_EQ(request.find("Injected"), std::string::npos);
+  EXPECT_EQ(request.find("Evil"), std::string::npos);
+}
+
+TEST_F(CurlWebClientTest, WithoutAUserAgentNoneIsSent) {
+  std::promise<std::string> seen;
+  HttpsServer server(identity, [&](Connection& connection) {
+    seen.set_value(connection.readRequest());
+    connection.respond("200 OK", "x");
+  });
+  fetch(server.url());
+  const std::string request = seen.get_future().get();
+  EXPECT_EQ(request.find("User-Agent"), std::string::npos);
+  EXPECT_EQ(request.find("Accept-Encoding"), std::string::npos);
+}
+
+TEST_F(CurlWebClientTest, EveryStatusIsAResponse) {
+  int status = 0;
+  HttpsServer server(identity, [&](Connection& connection) {
+    connection.readRequest();
+    connection.respond(std::to_string(status) + " Something", status == 304 ? "" : "text");
+  });
+  for (const int each : {204, 304, 404, 500, 302}) {  // the redirect names no place
+    status = each;
+    const auto response = fetch(server.url());
+    expectKind(WebErrorKind::none, response);
+    EXPECT_EQ(response->statusCode, each);
+  }
+}
+
+TEST_F(CurlWebClientTest, HeadersOfAnInterimResponseAndTrailersDoNotCount) {
+  HttpsServer server(identity, [&](Connection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 103 Early Hints\r\nEarly: yes\r\n\r\n");
+    connection.write(
+        "HTTP/1.1 200 OK\r\nTransfer-Encoding: chunked\r\nContent-Type: a\r\n\r\n3\r\nabc\r\n0\r\n");
+    connection.write("Content-Type: b\r\nLate: yes\r\n\r\n");
+  });
+  const auto response = fetch(server.url());
+  expectKind(WebErrorKind::none, response);
+  EXPECT_EQ(textOf(*response), "abc");
+  EXPECT_FALSE(response->headers.contains("Early"));
+  EXPECT_FALSE(response->headers.contains("Late"));
+  EXPECT_EQ(response->headers["Content-Type"], "a");
+}
+
+TEST_F(CurlWebClientTest, ContentEncodingIsDecodedAndContentTypeIsNot) {
+  const std::string packed = gzip("unpacked");
+  HttpsServer server(identity, [&](Connection& connection) {
+    const auto request = connection.readRequest();
+    const bool encoded = request.find("/encoded") != std::string::npos;
+    connection.respond(std::string("200 OK\r\nContent-Type: application/gzip") +
+                           (encoded ? "\r\nContent-Encoding: gzip" : ""),
+                       packed);
+  });
+  Options options;
+  options.headers = {{"accept-encoding", "gzip"}};
+  EXPECT_EQ(textOf(*fetch(server.url("/encoded"), options)), "unpacked");
+  const auto plain = fetch(server.url("/plain"), options);
+  EXPECT_EQ(textOf(*plain), packed);
+  EXPECT_EQ(plain->headers["Content-Type"], "application/gzip");
+  EXPECT_EQ(textOf(*fetch(server.url("/encoded"))), packed) << "not asked for, so not decoded";
+}
+
+TEST_F(CurlWebClientTest, UrlsThatCannotBeUsedMakeNoRequest) {
+  makeClient();
+  const auto session = client->makeSession();
+  for (const std::string& url :
+       {std::string(), std::string("nonsense"), std::string("http://localhost/"),
+        std::string("ftp://localhost/"), std::string("file:///etc/passwd"), std::string("https://"),
+        std::string("https://local host/"), std::string("https://localhost/a b"),
+        std::string("https://localhost/\n"), std::string("https://localhost:99999/"),
+        std::string("https://localhost/\0x", 20)}) {
+    EXPECT_EQ(client->makeRequest(WebRequestType::get, url, {}, session), nullptr) << url;
+  }
+  EXPECT_NE(client->makeRequest(WebRequestType::get, "HTTPS://localhost/", {}, session), nullptr);
+  EXPECT_NE(client->makeRequest(WebRequestType::get, "https://[::1]:8443", {}, session), nullptr);
+}
+
+// ---- failures: the completion always comes ----
+
+TEST_F(CurlWebClientTest, ARefusedConnectionIsTold) {
+  std::uint16_t port = 0;
+  {
+    port = HttpsServer(identity, [](Connection&) {}).port();
+  }
+  const auto response = fetch("https://127.0.0.1:" + std::to_string(port) + "/");
+  expectKind(WebErrorKind::cannotConnect, response);
+  EXPECT_EQ(response->statusCode, 0);
+}
+
+TEST_F(CurlWebClientTest, AServerThatSaysNothingIsGivenUp) {
+  settings.connectLimit = 200ms;
+  HttpsServer server([](Connection& connection) { connection.stall(); }, HttpsServer::Wire::plain);
+  expectKind(WebErrorKind::timedOut, fetch(server.url()));
+}
+
+TEST_F(CurlWebClientTest, ATransferThatStallsIsGivenUp) {
+  settings.stallLimit = 2s;
+  HttpsServer server(identity, [](Connection& connection) {
+    if (connection.readRequest().find("/body") != std::string::npos) {
+      connection.write("HTTP/1.1 200 OK\r\nContent-Length: 100000\r\n\r\nbeginning");
+    }
+    connection.stall();
+  });
+  auto first = start(server.url("/headers"), {});
+  auto second = start(server.url("/body"), {});
+  expectKind(WebErrorKind::timedOut, first.get());
+  expectKind(WebErrorKind::timedOut, second.get());
+}
+
+TEST_F(CurlWebClientTest, TheRequestsOwnLimitEndsASteadyTransferAndCountsRedirects) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 200 OK\r\nContent-Length: 500000000\r\n\r\n");
+    const std::string piece(10'000, 'x');
+    while (connection.write(piece)) std::this_thread::yield();
+  });
+  HttpsServer redirecting(identity, [&](Connection& connection) {
+    connection.readRequest();
+    connection.respond("302 Found\r\nLocation: " + server.url(), "");
+  });
+  Options options;
+  options.timeLimit = 150ms;
+  const auto before = std::chrono::steady_clock::now();
+  expectKind(WebErrorKind::timedOut, fetch(redirecting.url(), options));
+  EXPECT_GE(std::chrono::steady_clock::now() - before, 150ms);
+}
+
+TEST_F(CurlWebClientTest, AConnectionResetOrCutIsTold) {
+  HttpsServer server(identity, [](Connection& connection) {
+    const auto request = connection.readRequest();
+    if (request.find("/nothing") != std::string::npos) return connection.finishTls();
+    connection.write("HTTP/1.1 200 OK\r\nContent-Length: 100000\r\n\r\nbeginning");
+    if (request.find("/reset") != std::string::npos) return connection.reset();
+    if (request.find("/short") != std::string::npos) connection.finishTls();
+  });
+  for (const char* path : {"/nothing", "/reset", "/short", "/cut"}) {
+    SCOPED_TRACE(path);
+    expectKind(WebErrorKind::connectionLost, fetch(server.url(path)));
+  }
+}
+
+TEST_F(CurlWebClientTest, ABodyWithoutLengthEndsWithTheConnection) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 200 OK\r\nConnection: close\r\n\r\nall there is");
+    connection.finishTls();
+  });
+  EXPECT_EQ(textOf(*fetch(server.url())), "all there is");
+}
+
+TEST_F(CurlWebClientTest, ACertificateThatIsNotTrustedIsRefused) {
+  const Identity stranger("Somebody else");
+  const Identity untrusted(stranger, kLocalNames);
+  HttpsServer server(untrusted, [](Connection& connection) { connection.respond("200 OK", "secret"); });
+  expectKind(WebErrorKind::certificateRefused, fetch(server.url()));
+}
+
+TEST_F(CurlWebClientTest, ACertificateSignedInTheAuthoritysNameByAnotherKeyIsRefused) {
+  const Identity impostor;  // of the same name as the trusted one
+  const Identity forged(impostor, kLocalNames);
+  HttpsServer server(forged, [](Connection& connection) { connection.respond("200 OK", "secret"); });
+  const auto response = fetch(server.url());
+  EXPECT_NE(response->errorKind, WebErrorKind::none);
+  EXPECT_EQ(response->statusCode, 0);
+  EXPECT_TRUE(response->body.empty());
+}
+
+TEST_F(CurlWebClientTest, ACertificateOfAnotherNameIsRefused) {
+  const Identity other(authority, "DNS:other.example");
+  HttpsServer server(other, [](Connection& connection) { connection.respond("200 OK", "secret"); });
+  expectKind(WebErrorKind::certificateRefused, fetch(server.url()));
+}
+
+TEST_F(CurlWebClientTest, ACertificateOutsideItsTimePointsAtTheClock) {
+  const Identity expired(authority, kLocalNames, {-48h, -24h});
+  const Identity future(authority, kLocalNames, {24h, 48h});
+  for (const Identity* each : {&expired, &future}) {
+    HttpsServer server(*each, [](Connection& connection) { connection.respond("200 OK", "x"); });
+    expectKind(WebErrorKind::certificateClock, fetch(server.url()));
+  }
+}
+
+TEST_F(CurlWebClientTest, AServerWithoutTlsIsNoSecureConnection) {
+  HttpsServer server([](Connection& connection) { connection.respond("200 OK", "plain"); },
+                     HttpsServer::Wire::plain);
+  expectKind(WebErrorKind::secureConnection, fetch(server.url()));
+}
+
+TEST_F(CurlWebClientTest, WhatIsNotHttpIsMalformed) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.write("SSH-2.0-something\r\nand more of it\r\n");
+    connection.finishTls();
+  });
+  expectKind(WebErrorKind::malformedResponse, fetch(server.url()));
+}
+
+TEST_F(CurlWebClientTest, HeadersWithoutEndAreMalformed) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 200 OK\r\n");
+    const std::string line = "X-Filler: " + std::string(1000, 'x') + "\r\n";
+    for (int i = 0; i < 1000 && connection.write(line); ++i) {
+    }
+  });
+  expectKind(WebErrorKind::malformedResponse, fetch(server.url()));
+}
+
+TEST_F(CurlWebClientTest, ABodyBeyondTheLimitIsRefusedAnnouncedOrNot) {
+  HttpsServer server(identity, [](Connection& connection) {
+    const auto request = connection.readRequest();
+    if (request.find("/announced") != std::string::npos) {
+      connection.write("HTTP/1.1 200 OK\r\nContent-Length: 1000001\r\n\r\n");
+    } else {
+      connection.write("HTTP/1.1 200 OK\r\nConnection: close\r\n\r\n");
+    }
+    connection.write(std::string(request.find("/exact") != std::string::npos ? 1'000'000 : 1'000'001, 'x'));
+    connection.finishTls();
+  });
+  Options options;
+  options.largestBody = 1'000'000;
+  expectKind(WebErrorKind::bodyTooLarge, fetch(server.url("/announced"), options));
+  expectKind(WebErrorKind::bodyTooLarge, fetch(server.url("/streamed"), options));
+  EXPECT_EQ(fetch(server.url("/exact"), options)->body.size(), 1'000'000U);
+}
+
+TEST_F(CurlWebClientTest, TheLimitCannotBeRaisedAboveTheClientsOwn) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 200 OK\r\nContent-Length: 536870913\r\n\r\n");
+  });
+  Options options;
+  options.largestBody = ~std::uint64_t{0};
+  expectKind(WebErrorKind::bodyTooLarge, fetch(server.url(), options));
+}
+
+TEST_F(CurlWebClientTest, TheLimitCountsDecodedBytes) {
+  const std::string bomb = gzip(std::string(20'000'000, '\0'));
+  HttpsServer server(identity, [&](Connection& connection) {
+    connection.readRequest();
+    connection.respond("200 OK\r\nContent-Encoding: gzip", bomb);
+  });
+  Options options;
+  options.headers = {{"Accept-Encoding", "gzip"}};
+  options.largestBody = 1'000'000;
+  expectKind(WebErrorKind::bodyTooLarge, fetch(server.url(), options));
+}
+
+TEST_F(CurlWebClientTest, ContentThatDoesNotDecodeIsMalformed) {
+  HttpsServer server(identity, [&](Connection& connection) {
+    connection.readRequest();
+    connection.respond("200 OK\r\nContent-Encoding: gzip", "this is not gzip at all");
+  });
+  Options options;
+  options.headers = {{"Accept-Encoding", "gzip"}};
+  expectKind(WebErrorKind::malformedResponse, fetch(server.url(), options));
+}
+
+// ---- redirects ----
+
+TEST_F(CurlWebClientTest, ARedirectToHttpsIsFollowedAbsoluteOrRelative) {
+  HttpsServer target(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.respond("200 OK\r\nX-At: target", "arrived");
+  });
+  HttpsServer server(identity, [&](Connection& connection) {
+    const auto request = connection.readRequest();
+    if (request.starts_with("GET /here/there ")) return connection.respond("200 OK", "relative");
+    const bool relative = request.find("/here") != std::string::npos;
+    connection.respond("302 Found\r\nX-At: first\r\nLocation: " + (relative ? "there" : target.url()),
+                       "moved");
+  });
+  const auto response = fetch(server.url("/away"));
+  expectKind(WebErrorKind::none, response);
+  EXPECT_EQ(textOf(*response), "arrived");
+  EXPECT_EQ(response->headers["X-At"], "target");
+  EXPECT_EQ(textOf(*fetch(server.url("/here/from"))), "relative");
+}
+
+TEST_F(CurlWebClientTest, ARedirectToHttpIsRefusedAndNobodyIsAsked) {
+  HttpsServer plain([](Connection& connection) { connection.respond("200 OK", "plain"); },
+                    HttpsServer::Wire::plain);
+  HttpsServer server(identity, [&](Connection& connection) {
+    connection.readRequest();
+    connection.respond("301 Moved\r\nLocation: http://localhost:" + std::to_string(plain.port()) + "/",
+                       "moved");
+  });
+  const auto response = fetch(server.url());
+  expectKind(WebErrorKind::redirectRefused, response);
+  EXPECT_EQ(response->statusCode, 301);
+  EXPECT_EQ(plain.connections(), 0);
+}
+
+TEST_F(CurlWebClientTest, RedirectsThatDoNotEndAreGivenUp) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.respond("307 Again\r\nLocation: /", "");
+  });
+  expectKind(WebErrorKind::tooManyRedirects, fetch(server.url()));
+  EXPECT_EQ(server.connections(), 11);
+}
+
+// ---- the client's own life ----
+
+TEST_F(CurlWebClientTest, ManyRequestsAtOnceEachCompleteOnce) {
+  HttpsServer server(identity, [](Connection& connection) {
+    const auto request = connection.readRequest();
+    if (request.find("/reset") != std::string::npos) return connection.reset();
+    connection.respond("200 OK", request.substr(4, request.find(' ', 4) - 4));
+  });
+  std::vector<std::future<std::shared_ptr<WebResponse>>> answers;
+  for (int i = 0; i < 40; ++i)
+    answers.push_back(start(server.url((i % 2 ? "/reset" : "/n") + std::to_string(i)), {}));
+  for (int i = 0; i < 40; ++i) {
+    const auto response = answers[static_cast<std::size_t>(i)].get();
+    if (i % 2) {
+      EXPECT_NE(response->errorKind, WebErrorKind::none);
+    } else {
+      EXPECT_EQ(textOf(*response), "/n" + std::to_string(i));
+    }
+  }
+}
+
+TEST_F(CurlWebClientTest, WhatIsUnderWayWhenTheClientIsDestroyedCompletesAsCancelled) {
+  std::promise<void> reached;
+  HttpsServer server(identity, [&](Connection& connection) {
+    connection.readRequest();
+    reached.set_value();
+    connection.stall();
+  });
+  auto answer = start(server.url(), {});
+  reached.get_future().wait();
+  const auto late = client->makeRequest(WebRequestType::get, server.url(), {}, client->makeSession());
+  std::promise<std::shared_ptr<WebResponse>> lateAnswer;
+  late->setCallbackQueue(callbackQueue);
+  late->setCompletion(
+      [&](std::shared_ptr<WebResponse> response) { lateAnswer.set_value(std::move(response)); });
+  client.reset();
+  expectKind(WebErrorKind::cancelled, answer.get());
+  late->send({});
+  expectKind(WebErrorKind::cancelled, lateAnswer.get_future().get());
+}
+
+TEST_F(CurlWebClientTest, ARequestNobodyWaitsForIsHarmless) {
+  makeClient();
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.respond("200 OK", "x");
+  });
+  const auto request = client->makeRequest(WebRequestType::get, server.url(), {}, client->makeSession());
+  request->send({});
+  EXPECT_EQ(fetch(server.url())->statusCode, 200);
+}
+
+// ---- names and cellular, in networks of our own ----
+
+class CurlWebClientNetworkTest : public CurlWebClientTest {
+ protected:
+  void SetUp() override {
+    if (!ours.isMade() || !theirs.isMade()) GTEST_SKIP() << "no permission to make a network namespace";
+    ASSERT_TRUE(ours.ip("link set lo up"));
+    settings.connectLimit = 300ms;
+    settings.cellularFiles.nameServers = folder / "resolv.conf";
+    settings.cellularFiles.hosts = folder / "hosts";
+    std::ofstream(settings.cellularFiles.nameServers) << "nameserver 203.0.113.53\n";
+  }
+  // `name` here, 10.7.N.1, joined to farN there, 10.7.N.2.
+  void join(const std::string& name, int number) {
+    const std::string n = std::to_string(number);
+    ASSERT_TRUE(ours.ip("link add " + name + " type veth peer name far" + n + " netns " + theirs.name()));
+    ASSERT_TRUE(ours.ip("address add 10.7." + n + ".1/24 dev " + name));
+    ASSERT_TRUE(ours.ip("link set " + name + " up"));
+    ASSERT_TRUE(theirs.ip("address add 10.7." + n + ".2/24 dev far" + n));
+    ASSERT_TRUE(theirs.ip("link set far" + n + " up"));
+    theirs.run([&] { taps.push_back(std::make_unique<PacketTap>(("far" + n).c_str())); });
+    ASSERT_TRUE(taps.back()->isMade());
+  }
+  // The client and its threads live in our network.
+  WebErrorKind outcome(const std::string& url, bool cellularAllowed) {
+    WebErrorKind kind{};
+    ours.run([&] {
+      client.reset();
+      Options options;
+      options.cellularAllowed = cellularAllowed;
+      kind = fetch(url, options)->errorKind;
+    });
+    return kind;
+  }
+  std::size_t arrived(std::size_t tap, std::size_t atLeast = 0) {
+    return taps.at(tap)->packets(atLeast, atLeast > 0 ? 2000ms : 0ms).size();
+  }
+
+  PrivateNetwork ours;
+  PrivateNetwork theirs;
+  std::vector<std::unique_ptr<PacketTap>> taps;
+};
+
+TEST_F(CurlWebClientNetworkTest, WhereOnlyCellularLeadsOutNothingLeavesLookUpsIncluded) {
+  join("pdp_ip0", 1);
+  ASSERT_TRUE(ours.ip("route add default via 10.7.1.2"));
+  EXPECT_EQ(outcome("https://10.7.1.2/", false), WebErrorKind::cellularNotAllowed);
+  EXPECT_EQ(outcome("https://203.0.113.9/", false), WebErrorKind::cellularNotAllowed);
+  EXPECT_EQ(outcome("https://lasd.example/", false), WebErrorKind::cellularNotAllowed);
+  EXPECT_EQ(arrived(0), 0U);
+  EXPECT_EQ(outcome("https://10.7.1.2/", true), WebErrorKind::cannotConnect) << "allowed, and nobody listens";
+  EXPECT_GE(arrived(0, 1), 1U);
+}
+
+TEST_F(CurlWebClientNetworkTest, WithAnotherWayTheConnectionTakesItAndCellularStaysSilent) {
+  join("pdp_ip0", 1);
+  join("wifi0", 2);
+  ASSERT_TRUE(ours.ip("route add default via 10.7.1.2"));
+  EXPECT_EQ(outcome("https://10.7.2.2/", false), WebErrorKind::cannotConnect);
+  EXPECT_GE(arrived(1, 1), 1U);
+  EXPECT_EQ(outcome("https://203.0.113.9/", false), WebErrorKind::cellularNotAllowed);
+  EXPECT_EQ(outcome("https://lasd.example/", false), WebErrorKind::cellularNotAllowed)
+      << "its name server is there";
+  EXPECT_EQ(arrived(0), 0U);
+}
+
+TEST_F(CurlWebClientNetworkTest, ThisMachineItselfIsReachedWithoutANetwork) {
+  join("pdp_ip0", 1);
+  ASSERT_TRUE(ours.ip("route add default via 10.7.1.2"));
+  std::unique_ptr<HttpsServer> server;
+  ours.run([&] {
+    server = std::make_unique<HttpsServer>(identity, [](Connection& connection) {
+      connection.readRequest();
+      connection.respond("200 OK", "near");
+    });
+  });
+  EXPECT_EQ(outcome(server->url("/", "localhost"), false), WebErrorKind::none);
+  EXPECT_EQ(outcome(server->url("/", "127.0.0.1"), false), WebErrorKind::none);
+  EXPECT_EQ(arrived(0), 0U);
+}
+
+TEST_F(CurlWebClientNetworkTest, WithoutARouteThereIsNoConnection) {
+  EXPECT_EQ(outcome("https://203.0.113.9/", false), WebErrorKind::cannotConnect);
+  EXPECT_EQ(outcome("https://203.0.113.9/", true), WebErrorKind::cannotConnect);
+}
+
+TEST_F(CurlWebClientNetworkTest, ANameServerThatIsDeadOrOutOfReachDoesNotHoldTheCompletion) {
+  const auto before = std::chrono::steady_clock::now();
+  const auto unreachable = outcome("https://lasd.example/", false);
+  EXPECT_TRUE(unreachable == WebErrorKind::hostNotFound || unreachable == WebErrorKind::timedOut);
+  join("wifi0", 2);
+  // Its neighbour never answers, so neither does the name server of this machine's own configuration.
+  ASSERT_TRUE(ours.ip("route add default via 10.7.2.9"));
+  EXPECT_EQ(outcome("https://lasd.example/", false), WebErrorKind::timedOut);
+  EXPECT_LT(std::chrono::steady_clock::now() - before, 5s);
+}
+
+}  // namespace
+}  // namespace brenvik
