@@ -9,7 +9,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
+#include <csignal>
 #include <cstdio>
+#include <ctime>
 #include <fstream>
 #include <functional>
 #include <string>
@@ -46,6 +49,21 @@ inline void inPrivateMounts(const std::function<void()>& body) {
 inline void mountSmallDisk(const std::string& directory, int kibibytes) {
   const std::string options = "size=" + std::to_string(kibibytes) + "k";
   ASSERT_EQ(::mount("tmpfs", directory.c_str(), "tmpfs", 0, options.c_str()), 0);
+}
+
+// Has the kernel kill the calling process, a forked child of a test, when the time is over.
+inline void killThisProcessAfter(std::chrono::microseconds time) {
+  sigevent event{};
+  event.sigev_notify = SIGEV_SIGNAL;
+  event.sigev_signo = SIGKILL;
+  timer_t timer{};
+  itimerspec when{};
+  when.it_value.tv_sec = static_cast<time_t>(time.count() / 1'000'000);
+  when.it_value.tv_nsec = static_cast<long>(time.count() % 1'000'000 * 1000);
+  if (::timer_create(CLOCK_MONOTONIC, &event, &timer) != 0 ||
+      ::timer_settime(timer, 0, &when, nullptr) != 0) {
+    ::_exit(99);
+  }
 }
 
 }  // namespace brenvik
