@@ -1,0 +1,343 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "helper/carrier/FileSystemManager.h"
+
+#include <libgen.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+#include <span>
+
+namespace brenvik {
+namespace {
+
+constexpr int kUnexplained = 5;    // the platform failed and did not say why
+constexpr int kPosixFailure = -1;  // what a POSIX call returned
+constexpr mode_t kDirectoryMode = 0755;
+constexpr std::size_t kPathBuffer = 1024;
+
+// Runs work that may run out of memory, at the boundary that nothing is thrown across.
+template <typename Result, typename Work>
+Result guarded(Result onExhaustion, Work work) noexcept {
+  try {
+    return work();
+  } catch (const std::bad_alloc&) {
+    return onExhaustion;
+  }
+}
+
+// The path as it fits a fixed buffer: cut, and terminated.
+std::array<char, kPathBuffer> cutCopy(const std::string& path) {
+  std::array<char, kPathBuffer> copy{};
+  path.copy(copy.data(), copy.size() - 1);
+  return copy;
+}
+
+bool isForWantOfRoom(const FileOutcome& outcome) {
+  const int code = outcome.codeOr(0);
+  return code == ENOSPC || code == EDQUOT;
+}
+
+}  // namespace
+
+FileSystemFactory FileSystemManager::factory(FileManager& files) {
+  return [&files]() -> std::unique_ptr<FileSystemInterface> {
+    return std::unique_ptr<FileSystemInterface>(new (std::nothrow) FileSystemManager(files));
+  };
+}
+
+FileOutcome FileSystemManager::transfer(Mode mode, const std::string& source, const std::string& destination,
+                                        IfPresent ifPresent) {
+  return mode == Mode::move ? files().moveItem(source, destination, ifPresent)
+                            : files().copyItem(source, destination, ifPresent);
+}
+
+int FileSystemManager::copyOrMove(Mode mode, const std::string& source, const std::string& destination,
+                                  uid_t uid, gid_t gid) {
+  struct stat info {};
+  if (::stat(source.c_str(), &info) != 0) return kPosixFailure;
+  bool destinationIsDirectory = false;
+  if (!files().itemExists(destination, &destinationIsDirectory)) {
+    (void)::chown(source.c_str(), uid, gid);  // an item that cannot be given away is still transferred
+    return transfer(mode, source, destination, IfPresent::fail).codeOr(kUnexplained);
+  }
+  if (!destinationIsDirectory && S_ISDIR(info.st_mode)) return EEXIST;
+
+  std::string effective = destination;
+  bool gives = true;  // what stands at the effective destination
+  if (destinationIsDirectory) {
+    effective += '/';
+    effective += baseName(source);
+    bool isDirectoryThere = false;
+    gives = files().itemExists(effective, &isDirectoryThere) && !isDirectoryThere;
+  }
+  (void)::chown(source.c_str(), uid, gid);
+  merge(mode, source, effective, gives ? IfPresent::replaceNonDirectory : IfPresent::fail);
+  return 0;
+}
+
+// Takes the items below the source of a merge to the destination, one by one.
+class FileSystemManager::Merge final : public ItemVisitor {
+ public:
+  Merge(FileSystemManager& owner, Mode mode, const std::string& source, const std::string& destination)
+      : owner_(owner), mode_(mode), source_(source), destination_(destination) {}
+
+  Next visit(const std::string& subpath, bool isDirectory) noexcept override {
+    return guarded(Next::skipBelow, [&] { return transferItem(subpath, isDirectory); });
+  }
+
+ private:
+  Next transferItem(const std::string& subpath, bool isDirectory) {
+    const std::string from = source_ + "/" + subpath;
+    const std::string to = destination_ + "/" + subpath;
+    bool fromIsDirectory = false;
+    bool toIsDirectory = false;
+    const bool bothExist =
+        owner_.files().itemExists(from, &fromIsDirectory) && owner_.files().itemExists(to, &toIsDirectory);
+    std::string parent = owner_.directoryName(to);
+    if (parent != lastParent_) {
+      (void)owner_.createDirectory(parent, kDirectoryMode, true);  // without it the transfer fails by itself
+      lastParent_ = std::move(parent);
+    }
+    // Replaced in one step: a full disk or a kill leaves the old file or the new one.
+    const FileOutcome outcome = owner_.transfer(
+        mode_, from, to,
+        bothExist && !fromIsDirectory && !toIsDirectory ? IfPresent::replaceNonDirectory : IfPresent::fail);
+    if (outcome.succeeded()) return Next::skipBelow;  // a directory came over with all that is in it
+    // Below a link the items would be written to wherever it points.
+    return isDirectory && owner_.isSymbolicLink(to) ? Next::skipBelow : Next::descend;
+  }
+
+  FileSystemManager& owner_;
+  const Mode mode_;
+  const std::string& source_;
+  const std::string& destination_;
+  std::string lastParent_;
+};
+
+void FileSystemManager::merge(Mode mode, const std::string& source, const std::string& destination,
+                              IfPresent ifPresent) {
+  const FileOutcome whole = transfer(mode, source, destination, ifPresent);
+  if (whole.succeeded()) return;
+  bool sourceIsDirectory = false;
+  if (!files().itemExists(source, &sourceIsDirectory) || sourceIsDirectory) {
+    // A file in a directory's way is still there; it stays when there is no room for the directory.
+    if (ifPresent == IfPresent::replaceNonDirectory && !isForWantOfRoom(whole)) {
+      (void)files().removeItem(destination);  // if it stays, the items below fail one by one
+    }
+    Merge items(*this, mode, source, destination);
+    (void)files().enumerateBelow(source, items);  // a merge reports nothing
+  }
+  // Of a copied directory, too: it goes if it is empty.
+  (void)::rmdir(source.c_str());
+}
+
+int FileSystemManager::moveItem(const std::string& source, const std::string& destination) noexcept {
+  return moveItemWithOwner(source, destination, ::getuid(), ::getgid());
+}
+
+int FileSystemManager::moveItemWithOwner(const std::string& source, const std::string& destination, uid_t uid,
+                                         gid_t gid) noexcept {
+  return guarded(ENOMEM, [&] { return copyOrMove(Mode::move, source, destination, uid, gid); });
+}
+
+int FileSystemManager::moveDirectory(const std::string& source, const std::string& destination) noexcept {
+  struct stat info {};
+  if (::stat(source.c_str(), &info) != 0) return kPosixFailure;
+  (void)setOwner(source, ::getuid(), ::getgid(), true);  // what keeps its owner is moved all the same
+  return files().moveItem(source, destination, IfPresent::fail).codeOr(kUnexplained);
+}
+
+int FileSystemManager::copyItem(const std::string& source, const std::string& destination) noexcept {
+  return guarded(ENOMEM, [&] { return copyOrMove(Mode::copy, source, destination, ::getuid(), ::getgid()); });
+}
+
+int FileSystemManager::copyFileIntoDirectory(const std::string& sourceDirectory,
+                                             const std::string& destinationDirectory,
+                                             const std::string& name) noexcept {
+  if (!itemExists(destinationDirectory) && createDirectory(destinationDirectory, kDirectoryMode, true) != 0) {
+    return kPosixFailure;
+  }
+  return guarded(ENOMEM, [&] {
+    return copyOrMove(Mode::copy, sourceDirectory + "/" + name, destinationDirectory + "/" + name, ::getuid(),
+                      ::getgid());
+  });
+}
+
+int FileSystemManager::setAttributesBelow(const std::string& path, const ItemAttributes& attributes) {
+  class Setter final : public ItemVisitor {
+   public:
+    Setter(FileManager& files, const std::string& path, const ItemAttributes& attributes)
+        : files_(files), path_(path), attributes_(attributes) {}
+    Next visit(const std::string& subpath, bool) noexcept override {
+      return guarded(Next::descend, [&] {
+        const FileOutcome outcome = files_.setAttributes(path_ + "/" + subpath, attributes_);
+        if (const int code = outcome.codeOr(0); code != 0) last_ = code;
+        return Next::descend;
+      });
+    }
+    int lastFailure() const { return last_; }
+
+   private:
+    FileManager& files_;
+    const std::string& path_;
+    const ItemAttributes& attributes_;
+    int last_ = 0;
+  };
+
+  bool isDirectoryThere = false;
+  if (!files().itemExists(path, &isDirectoryThere)) return kUnexplained;
+  int below = 0;
+  if (isDirectoryThere) {
+    Setter setter(files(), path, attributes);
+    (void)files().enumerateBelow(path, setter);  // what cannot be listed has no items to set
+    below = setter.lastFailure();
+  }
+  const int top = files().setAttributes(path, attributes).codeOr(0);
+  return top != 0 ? top : below;
+}
+
+int FileSystemManager::setPermissions(const std::string& path, mode_t mode, bool recursive) noexcept {
+  if (!recursive) return ::chmod(path.c_str(), mode);
+  return guarded(ENOMEM, [&] { return setAttributesBelow(path, {mode, {}, {}}); });
+}
+
+int FileSystemManager::setOwner(const std::string& path, uid_t uid, gid_t gid, bool recursive) noexcept {
+  if (!recursive) return ::chown(path.c_str(), uid, gid);
+  return guarded(ENOMEM, [&] { return setAttributesBelow(path, {{}, uid, gid}); });
+}
+
+int FileSystemManager::createDirectory(const std::string& path, mode_t mode, bool intermediate) noexcept {
+  return createDirectoryWithOwner(path, mode, {}, {}, intermediate);
+}
+
+int FileSystemManager::createDirectoryWithOwner(const std::string& path, mode_t mode,
+                                                const std::string& ownerName, const std::string& groupName,
+                                                bool intermediate) noexcept {
+  return files()
+      .createDirectory(path, {mode, ownerName, groupName},
+                       intermediate ? Intermediates::create : Intermediates::mustExist)
+      .codeOr(0);
+}
+
+bool FileSystemManager::itemExists(const std::string& path) noexcept {
+  return files().itemExists(path, nullptr);
+}
+
+int FileSystemManager::listDirectory(const std::string& path, std::vector<std::string>* entries,
+                                     bool fullPaths) noexcept {
+  return guarded(ENOMEM, [&] {
+    entries->clear();
+    const FileOutcome outcome = files().listDirectory(path, entries);
+    if (fullPaths) {
+      const std::string base = path.ends_with('/') ? path : path + "/";
+      for (std::string& entry : *entries) entry.insert(0, base);
+    }
+    return outcome.codeOr(kUnexplained);
+  });
+}
+
+int FileSystemManager::findEntry(const std::string& directory, const std::string& namePrefix,
+                                 std::string* path) noexcept {
+  return guarded(ENOMEM, [&] {
+    path->clear();
+    std::vector<std::string> entries;
+    if (const int code = listDirectory(directory, &entries, false); code != 0) return code;
+    const std::string* found = nullptr;
+    for (const std::string& entry : entries) {
+      if (entry.starts_with(namePrefix) && (found == nullptr || entry < *found)) found = &entry;
+    }
+    if (found == nullptr) return ENOENT;
+    *path = (directory.ends_with('/') ? directory : directory + "/") + *found;
+    return 0;
+  });
+}
+
+int FileSystemManager::removeItem(const std::string& path) noexcept {
+  return files().removeItem(path).codeOr(kUnexplained);
+}
+
+std::string FileSystemManager::baseName(const std::string& path) noexcept {
+  return guarded(std::string(), [&] {
+    std::array<char, kPathBuffer> copy = cutCopy(path);
+    return std::string(::basename(copy.data()));
+  });
+}
+
+std::string FileSystemManager::directoryName(const std::string& path) noexcept {
+  return guarded(std::string(), [&] {
+    std::array<char, kPathBuffer> copy = cutCopy(path);
+    return std::string(::dirname(copy.data()));
+  });
+}
+
+std::string FileSystemManager::resolvePath(const std::string& path) noexcept {
+  const std::unique_ptr<char, decltype(&std::free)> resolved(::realpath(path.c_str(), nullptr), &std::free);
+  if (!resolved) return {};
+  return guarded(std::string(), [&] { return std::string(resolved.get()); });
+}
+
+std::string FileSystemManager::readLink(const std::string& path) noexcept {
+  std::array<char, kPathBuffer> target{};
+  const ssize_t length = ::readlink(path.c_str(), target.data(), target.size() - 1);
+  if (length < 0) return {};
+  return guarded(std::string(), [&] { return std::string(target.data(), static_cast<std::size_t>(length)); });
+}
+
+PropertyList FileSystemManager::readDictionary(const std::string& path) noexcept {
+  const std::optional<std::string> bytes = readData(path);
+  if (!bytes) return {};
+  PropertyList value = parsePropertyList(std::as_bytes(std::span(*bytes)));
+  return value.is(PropertyList::Type::dictionary) ? value : PropertyList();
+}
+
+std::optional<std::string> FileSystemManager::readData(const std::string& path) noexcept {
+  // No property list that is accepted is larger, and nothing else is read here.
+  return files().readFile(path, kLargestXmlForm);
+}
+
+bool FileSystemManager::writeDictionary(const std::string& path, const PropertyList& dictionary) noexcept {
+  if (!dictionary.is(PropertyList::Type::dictionary)) return false;
+  const std::optional<std::string> bytes = serializePropertyList(dictionary, PropertyListFormat::xml);
+  return bytes && files().writeFileAtomically(path, *bytes);
+}
+
+bool FileSystemManager::writePropertyList(const std::string& path, const PropertyList& propertyList,
+                                          PropertyListFormat format) noexcept {
+  const std::optional<std::string> bytes = serializePropertyList(propertyList, format);
+  return bytes && files().writeFile(path, *bytes);
+}
+
+bool FileSystemManager::writeData(const std::string& path, const std::string* data) noexcept {
+  return data != nullptr && files().writeFileAtomically(path, *data);
+}
+
+bool FileSystemManager::isSymbolicLink(const std::string& path) noexcept {
+  struct stat info {};
+  return ::lstat(path.c_str(), &info) == 0 && (info.st_mode & 0xF000) == 0xA000;
+}
+
+int FileSystemManager::createSymbolicLink(const std::string& linkPath, const std::string& target) noexcept {
+  return ::symlink(target.c_str(), linkPath.c_str()) == 0 ? 0 : errno;
+}
+
+bool FileSystemManager::isDirectory(const std::string& path) noexcept {
+  bool isDirectoryThere = false;
+  return files().itemExists(path, &isDirectoryThere) && isDirectoryThere;
+}
+
+bool FileSystemManager::createEmptyFile(const std::string& path) noexcept {
+  std::FILE* const file = std::fopen(path.c_str(), "we");
+  if (file == nullptr) return false;
+  (void)std::fclose(file);  // nothing was written
+  return true;
+}
+
+}  // namespace brenvik

@@ -1,0 +1,115 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <sys/types.h>
+
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace brenvik {
+
+// How a file operation ended. A failure carries an errno value, or 0 when the platform did not say why.
+class [[nodiscard]] FileOutcome {
+ public:
+  static constexpr FileOutcome success() { return FileOutcome(true, 0); }
+  static constexpr FileOutcome failure(int code) { return FileOutcome(false, code); }
+  static constexpr FileOutcome failureWithoutCode() { return FileOutcome(false, 0); }
+
+  constexpr bool succeeded() const { return succeeded_; }
+  // 0 on success; on failure its code, or `otherwise` when there is none.
+  constexpr int codeOr(int otherwise) const { return succeeded_ ? 0 : code_ != 0 ? code_ : otherwise; }
+  constexpr bool operator==(const FileOutcome&) const = default;
+
+ private:
+  constexpr FileOutcome(bool succeeded, int code) : succeeded_(succeeded), code_(code) {}
+  bool succeeded_;
+  int code_;
+};
+
+enum class IfPresent {
+  fail,                // EEXIST when anything, a dangling link included, stands at the destination
+  replaceNonDirectory  // what stands there gives way in one step, unless it is a directory (EEXIST)
+};
+
+enum class Intermediates { mustExist, create };
+
+struct DirectoryAttributes {
+  mode_t mode = 0755;          // exactly this, whatever the umask
+  std::string_view ownerName;  // account names; empty: as the system gives
+  std::string_view groupName;
+};
+
+struct ItemAttributes {
+  std::optional<mode_t> mode;  // links are passed over
+  std::optional<uid_t> uid;    // of a link itself, never of what it points to
+  std::optional<gid_t> gid;
+};
+
+// Is told of the items below a directory.
+class ItemVisitor {
+ public:
+  enum class Next { descend, skipBelow };
+  virtual ~ItemVisitor() = default;
+  // `subpath`: relative to the directory enumerated, no leading slash. `isDirectory`: of the item itself,
+  // links not followed. The answer counts for directories only. Must not throw.
+  virtual Next visit(const std::string& subpath, bool isDirectory) noexcept = 0;
+};
+
+// The platform's file manager: whole items, with data, modes, owners (as far as permitted), times, links and
+// extended attributes. Paths are NUL-terminated bytes. Links on the way to an item are followed; a link that
+// is itself the item is copied, moved or removed as a link, and nothing is ever written through one.
+//
+// A copy or a move shows at its destination whole or not at all, even when the process is killed. What a
+// killed copy leaves is a hidden ".brenvik-" item beside the destination; the next copy to the same
+// destination clears it away.
+//
+// One thread at a time. Blocks on the disk and nothing else. Throws nothing: memory exhaustion is ENOMEM.
+class FileManager {
+ public:
+  virtual ~FileManager() = default;
+
+  // Temporaries of the operations may live from openScope to closeScope; scopes nest.
+  virtual void openScope() noexcept = 0;
+  virtual void closeScope() noexcept = 0;
+
+  // Whether anything is at the path, links followed; then, if asked, whether it is a directory.
+  virtual bool itemExists(const std::string& path, bool* isDirectory) noexcept = 0;
+
+  // Fail with EINVAL when a directory would come to stand inside itself. moveItem is one rename inside a file
+  // system; across two it copies, then removes the source.
+  virtual FileOutcome copyItem(const std::string& source, const std::string& destination,
+                               IfPresent ifPresent) noexcept = 0;
+  virtual FileOutcome moveItem(const std::string& source, const std::string& destination,
+                               IfPresent ifPresent) noexcept = 0;
+  // With everything below it.
+  virtual FileOutcome removeItem(const std::string& path) noexcept = 0;
+
+  // With `create`, a directory that is there already is a success, and the attributes go to those made.
+  virtual FileOutcome createDirectory(const std::string& path, const DirectoryAttributes& attributes,
+                                      Intermediates intermediates) noexcept = 0;
+
+  // Appends the names of the entries, without "." and "..", in no particular order.
+  virtual FileOutcome listDirectory(const std::string& path, std::vector<std::string>* names) noexcept = 0;
+
+  // Calls the visitor for everything below the directory, each directory before what is in it. The names of a
+  // directory are read when it is descended into; the visitor may change the tree meanwhile. Links below are
+  // not followed. The failure reported is the first that kept a directory from being read.
+  virtual FileOutcome enumerateBelow(const std::string& path, ItemVisitor& visitor) noexcept = 0;
+
+  virtual FileOutcome setAttributes(const std::string& path, const ItemAttributes& attributes) noexcept = 0;
+
+  // The bytes of a regular file, at most `limit` of them; nothing when it is missing, larger, unreadable or
+  // not a regular file. Never waits for a writer.
+  virtual std::optional<std::string> readFile(const std::string& path, std::size_t limit) noexcept = 0;
+
+  // The old content or the new, durably, never a part. A file that is there passes its mode and owner on; a
+  // link that is there is replaced, not followed.
+  virtual bool writeFileAtomically(const std::string& path, std::string_view bytes) noexcept = 0;
+  // Truncates and writes in place, like a stream that was opened on the path. Refuses a link.
+  virtual bool writeFile(const std::string& path, std::string_view bytes) noexcept = 0;
+};
+
+}  // namespace brenvik

@@ -1,0 +1,42 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <sys/stat.h>
+
+#include <cstdlib>
+#include <memory>
+
+namespace brenvik {
+
+// Copies what a file is beside its name: its data, and its attributes. Keeps a buffer and what it learned
+// about the file systems between calls; make one for a request. One thread.
+class FileContents {
+ public:
+  // Copies the data of `source` into the empty file `destination`, both at their start; shared blocks where
+  // the file system can, holes stay holes. `info`: of the source. 0 or errno. May throw std::bad_alloc.
+  int copyData(int source, const struct stat& info, int destination);
+
+  enum class Owner { asCreated, asSource };
+  enum class Mode { asCreated, asSource };
+  // Gives `destination` the extended attributes, the mode and the times of `source`, and its owner where that
+  // is asked for and permitted; without the owner no set-id bit is passed on. Attributes that the destination
+  // cannot hold are left out; a full disk is an error. `asCreated`: it is right already. 0 or errno. May
+  // throw std::bad_alloc.
+  int copyAttributes(int source, const struct stat& info, int destination, Owner owner,
+                     Mode mode = Mode::asSource);
+
+ private:
+  char* buffer();
+  int copyRange(int source, int destination, off_t offset, off_t length);
+  int copyExtendedAttributes(int source, int destination);
+
+  struct Free {
+    void operator()(char* block) const noexcept { std::free(block); }
+  };
+  std::unique_ptr<char, Free> buffer_;
+  bool tryClone_ = true;
+  bool tryCopyRange_ = true;
+};
+
+}  // namespace brenvik

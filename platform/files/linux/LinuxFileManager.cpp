@@ -1,0 +1,404 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/files/linux/LinuxFileManager.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <grp.h>
+#include <pwd.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <new>
+
+#include "platform/files/linux/DirectoryNames.h"
+#include "platform/files/linux/HeldDirectory.h"
+#include "platform/files/linux/Placement.h"
+#include "platform/files/linux/TreeCopier.h"
+#include "platform/files/linux/TreeRemover.h"
+
+namespace brenvik {
+namespace {
+
+// Runs `work`, which answers 0 or an errno value, at the boundary that nothing is thrown across.
+template <typename Work>
+FileOutcome guarded(Work work) noexcept {
+  try {
+    const int error = work();
+    return error == 0 ? FileOutcome::success() : FileOutcome::failure(error);
+  } catch (const std::bad_alloc&) {
+    return FileOutcome::failure(ENOMEM);
+  }
+}
+
+bool isSameItem(const struct stat& a, const struct stat& b) {
+  return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
+}
+
+// Whether `directory` is `tree` or lies below it. Yes, too, when that cannot be found out.
+bool isInside(int directory, const struct stat& tree) {
+  struct stat here {};
+  if (::fstat(directory, &here) != 0) return true;
+  UniqueFd current;
+  for (int at = directory; !isSameItem(here, tree);) {
+    UniqueFd parent(::openat(at, "..", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    struct stat above {};
+    if (!parent.isValid() || ::fstat(parent.get(), &above) != 0) return true;
+    if (isSameItem(here, above)) return false;  // the root is its own parent
+    here = above;
+    current = std::move(parent);
+    at = current.get();
+  }
+  return true;
+}
+
+int writeAll(int file, std::string_view bytes) {
+  while (!bytes.empty()) {
+    const ssize_t put = ::write(file, bytes.data(), bytes.size());
+    if (put < 0 && errno == EINTR) continue;
+    if (put < 0) return errno;
+    bytes.remove_prefix(static_cast<std::size_t>(put));
+  }
+  return 0;
+}
+
+int idOfUser(std::string_view name, uid_t* uid) {
+  char buffer[4096];
+  passwd entry{};
+  passwd* found = nullptr;
+  const int error = ::getpwnam_r(std::string(name).c_str(), &entry, buffer, sizeof buffer, &found);
+  if (found == nullptr) return error != 0 ? error : EINVAL;
+  *uid = found->pw_uid;
+  return 0;
+}
+
+int idOfGroup(std::string_view name, gid_t* gid) {
+  std::string buffer(4096, '\0');
+  group entry{};
+  group* found = nullptr;
+  int error = 0;
+  const std::string text(name);
+  // A group of many members needs more room than any fixed size.
+  while ((error = ::getgrnam_r(text.c_str(), &entry, buffer.data(), buffer.size(), &found)) == ERANGE &&
+         buffer.size() < (1 << 20)) {
+    buffer.resize(buffer.size() * 2);
+  }
+  if (found == nullptr) return error != 0 ? error : EINVAL;
+  *gid = found->gr_gid;
+  return 0;
+}
+
+struct ResolvedAttributes {
+  mode_t mode;
+  uid_t uid = static_cast<uid_t>(-1);
+  gid_t gid = static_cast<gid_t>(-1);
+};
+
+// Makes one directory and gives it exactly these attributes; removes it again when it cannot have them.
+int makeDirectory(const char* path, const ResolvedAttributes& attributes) {
+  if (::mkdir(path, attributes.mode & 0700) != 0) return errno;
+  const UniqueFd made(::open(path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  int error = 0;
+  if (made.isValid()) {
+    const bool giveAway =
+        attributes.uid != static_cast<uid_t>(-1) || attributes.gid != static_cast<gid_t>(-1);
+    if (giveAway && ::fchown(made.get(), attributes.uid, attributes.gid) != 0) error = errno;
+    if (error == 0 && ::fchmod(made.get(), attributes.mode) != 0) error = errno;
+  } else if (::chmod(path, attributes.mode) != 0) {  // a mode without read, for an ordinary user
+    error = errno;
+  }
+  if (error != 0) (void)::rmdir(path);  // the failure already has its code
+  return error;
+}
+
+int makeDirectories(const std::string& path, const ResolvedAttributes& attributes) {
+  const int error = makeDirectory(path.c_str(), attributes);
+  struct stat info {};
+  if (error == EEXIST) {
+    return ::stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode) ? 0 : EEXIST;
+  }
+  if (error != ENOENT) return error;
+  // From the first directory that is missing, down.
+  for (std::size_t slash = path.find('/', 1); slash != std::string::npos; slash = path.find('/', slash + 1)) {
+    const std::string above = path.substr(0, slash);
+    if (::stat(above.c_str(), &info) == 0) continue;
+    if (const int failed = makeDirectory(above.c_str(), attributes); failed != 0 && failed != EEXIST)
+      return failed;
+  }
+  const int last = makeDirectory(path.c_str(), attributes);
+  // "a/b/" was made by the loop.
+  return last == EEXIST && ::stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode) ? 0 : last;
+}
+
+}  // namespace
+
+void LinuxFileManager::closeScope() noexcept {
+  if (--scopes_ == 0) contents_.reset();
+}
+
+FileContents& LinuxFileManager::contents() {
+  if (!contents_ || scopes_ == 0) contents_ = std::make_unique<FileContents>();
+  return *contents_;
+}
+
+bool LinuxFileManager::itemExists(const std::string& path, bool* isDirectory) noexcept {
+  struct stat info {};
+  const bool exists = ::stat(path.c_str(), &info) == 0;
+  if (isDirectory != nullptr) *isDirectory = exists && S_ISDIR(info.st_mode);
+  return exists;
+}
+
+int LinuxFileManager::copy(const std::string& source, const std::string& destination, IfPresent ifPresent) {
+  struct stat info {};
+  if (::lstat(source.c_str(), &info) != 0) return errno;
+  Place place;
+  if (const int error = Place::open(destination, &place); error != 0) return error;
+  struct stat there {};
+  const bool present = ::fstatat(place.directory.get(), place.name.c_str(), &there, AT_SYMLINK_NOFOLLOW) == 0;
+  if (present && (ifPresent == IfPresent::fail || S_ISDIR(there.st_mode))) return EEXIST;
+
+  Stage stage(place);
+  TreeCopier copier(contents(), ::geteuid(), ::getegid());
+  if (S_ISDIR(info.st_mode)) {
+    const UniqueFd from(::open(source.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (!from.isValid() || ::fstat(from.get(), &info) != 0) return errno;
+    if (isInside(place.directory.get(), info)) return EINVAL;
+    if (const int error = stage.makeDirectory(); error != 0) return error;
+    if (const int error = copier.copyDirectoryInto(from.get(), info, stage.get()); error != 0) return error;
+  } else if (S_ISREG(info.st_mode)) {
+    const UniqueFd from(::open(source.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    if (!from.isValid() || ::fstat(from.get(), &info) != 0) return errno;
+    if (!S_ISREG(info.st_mode)) return EBUSY;
+    if (const int error = stage.makeFile(); error != 0) return error;
+    if (const int error = copier.copyFileInto(from.get(), info, stage.get()); error != 0) return error;
+  } else {
+    if (const int error = stage.reserveName(); error != 0) return error;
+    if (const int error =
+            copier.copySpecial(AT_FDCWD, source.c_str(), info, place.directory.get(), stage.name());
+        error != 0) {
+      return error;
+    }
+    stage.nameIsTaken();
+  }
+  return stage.publish(ifPresent);
+}
+
+int LinuxFileManager::move(const std::string& source, const std::string& destination, IfPresent ifPresent) {
+  if (::renameat2(AT_FDCWD, source.c_str(), AT_FDCWD, destination.c_str(), RENAME_NOREPLACE) == 0) return 0;
+  int error = errno;
+  if (error == EINVAL || error == ENOSYS) {
+    // A file system without the flag, or a directory into itself, which the plain call refuses as well.
+    struct stat there {};
+    if (::lstat(destination.c_str(), &there) == 0) {
+      error = EEXIST;
+    } else {
+      if (::rename(source.c_str(), destination.c_str()) == 0) return 0;
+      error = errno;
+    }
+  }
+  if (error == EEXIST && ifPresent == IfPresent::replaceNonDirectory) {
+    struct stat from {};
+    struct stat there {};
+    if (::lstat(source.c_str(), &from) != 0 || ::lstat(destination.c_str(), &there) != 0) return errno;
+    if (S_ISDIR(there.st_mode)) return EEXIST;
+    if (isSameItem(from, there)) {
+      // rename(2) leaves two names of one file alone. They may even be one name.
+      Place a;
+      Place b;
+      if (const int failed = Place::open(source, &a); failed != 0) return failed;
+      if (const int failed = Place::open(destination, &b); failed != 0) return failed;
+      if (::fstat(a.directory.get(), &from) != 0 || ::fstat(b.directory.get(), &there) != 0) return errno;
+      if (a.name == b.name && isSameItem(from, there)) return 0;
+      return ::unlink(source.c_str()) == 0 ? 0 : errno;
+    }
+    if (!S_ISDIR(from.st_mode)) {
+      if (::rename(source.c_str(), destination.c_str()) == 0) return 0;
+      error = errno;
+    } else if (::renameat2(AT_FDCWD, source.c_str(), AT_FDCWD, destination.c_str(), RENAME_EXCHANGE) == 0) {
+      return ::unlink(source.c_str()) == 0 ? 0 : errno;
+    } else {
+      error = errno;
+    }
+  }
+  if (error != EXDEV) return error;
+  if (const int failed = copy(source, destination, ifPresent); failed != 0) return failed;
+  // The copy stands whole before the first byte of the source goes.
+  return removeTree(AT_FDCWD, source.c_str());
+}
+
+FileOutcome LinuxFileManager::copyItem(const std::string& source, const std::string& destination,
+                                       IfPresent ifPresent) noexcept {
+  return guarded([&] { return copy(source, destination, ifPresent); });
+}
+
+FileOutcome LinuxFileManager::moveItem(const std::string& source, const std::string& destination,
+                                       IfPresent ifPresent) noexcept {
+  return guarded([&] { return move(source, destination, ifPresent); });
+}
+
+FileOutcome LinuxFileManager::removeItem(const std::string& path) noexcept {
+  return guarded([&] { return removeTree(AT_FDCWD, path.c_str()); });
+}
+
+FileOutcome LinuxFileManager::createDirectory(const std::string& path, const DirectoryAttributes& attributes,
+                                              Intermediates intermediates) noexcept {
+  return guarded([&] {
+    ResolvedAttributes resolved{attributes.mode & 07777};
+    if (!attributes.ownerName.empty()) {
+      if (const int error = idOfUser(attributes.ownerName, &resolved.uid); error != 0) return error;
+    }
+    if (!attributes.groupName.empty()) {
+      if (const int error = idOfGroup(attributes.groupName, &resolved.gid); error != 0) return error;
+    }
+    return intermediates == Intermediates::create ? makeDirectories(path, resolved)
+                                                  : makeDirectory(path.c_str(), resolved);
+  });
+}
+
+FileOutcome LinuxFileManager::listDirectory(const std::string& path,
+                                            std::vector<std::string>* names) noexcept {
+  return guarded([&] {
+    const UniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!directory.isValid()) return errno;
+    DirectoryNames entries;
+    if (const int error = entries.load(directory.get()); error != 0) return error;
+    DirectoryNames::Entry entry{};
+    while (entries.next(&entry)) names->emplace_back(entry.name);
+    return 0;
+  });
+}
+
+FileOutcome LinuxFileManager::enumerateBelow(const std::string& path, ItemVisitor& visitor) noexcept {
+  struct Level {
+    HeldDirectory directory;
+    DirectoryNames names;
+    std::size_t pathLength;  // of the subpath down to this directory, its slash included
+  };
+  return guarded([&] {
+    int first = 0;
+    std::vector<Level> levels;
+    std::string subpath;
+    const auto enter = [&](UniqueFd fd) {
+      Level level{HeldDirectory(std::move(fd)), {}, subpath.size()};
+      if (const int error = level.names.load(level.directory.get()); error != 0) return error;
+      if (levels.size() >= kHeldLevels) {
+        if (const int error = levels[levels.size() - kHeldLevels].directory.giveUp(); error != 0)
+          return error;
+      }
+      levels.push_back(std::move(level));
+      return 0;
+    };
+    UniqueFd top(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!top.isValid()) return errno;
+    if (const int error = enter(std::move(top)); error != 0) return error;
+    while (!levels.empty()) {
+      Level& level = levels.back();
+      subpath.resize(level.pathLength);
+      DirectoryNames::Entry entry{};
+      if (level.names.next(&entry)) {
+        const bool isDirectory = entry.type == DT_DIR;
+        subpath += entry.name;
+        if (visitor.visit(subpath, isDirectory) == ItemVisitor::Next::skipBelow || !isDirectory) continue;
+        UniqueFd below(
+            ::openat(level.directory.get(), entry.name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        subpath += '/';
+        // ENOENT: the visitor took it away, or somebody else did.
+        const int error = below.isValid() ? enter(std::move(below)) : errno;
+        if (error != 0 && error != ENOENT && first == 0) first = error;
+        continue;
+      }
+      const Level done = std::move(levels.back());
+      levels.pop_back();
+      if (levels.empty()) break;
+      if (const int error = levels.back().directory.takeAgain(done.directory.get()); error != 0) {
+        return first != 0 ? first : error;
+      }
+    }
+    return first;
+  });
+}
+
+FileOutcome LinuxFileManager::setAttributes(const std::string& path,
+                                            const ItemAttributes& attributes) noexcept {
+  return guarded([&] {
+    if (attributes.uid || attributes.gid) {
+      const uid_t uid = attributes.uid.value_or(static_cast<uid_t>(-1));
+      const gid_t gid = attributes.gid.value_or(static_cast<gid_t>(-1));
+      if (::fchownat(AT_FDCWD, path.c_str(), uid, gid, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+    }
+    if (attributes.mode) {
+      struct stat info {};
+      if (::lstat(path.c_str(), &info) != 0) return errno;
+      if (!S_ISLNK(info.st_mode) && ::chmod(path.c_str(), *attributes.mode & 07777) != 0) return errno;
+    }
+    return 0;
+  });
+}
+
+std::optional<std::string> LinuxFileManager::readFile(const std::string& path, std::size_t limit) noexcept {
+  try {
+    const UniqueFd file(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    struct stat info {};
+    if (!file.isValid() || ::fstat(file.get(), &info) != 0 || !S_ISREG(info.st_mode)) return std::nullopt;
+    if (static_cast<std::size_t>(info.st_size) > limit) return std::nullopt;
+    std::string bytes;
+    // One byte more than it should have: the read that gets nothing ends it. Some files say they are empty.
+    std::size_t length = 0;
+    bytes.resize(static_cast<std::size_t>(info.st_size) + 1);
+    for (;;) {
+      if (length == bytes.size()) {
+        if (length > limit) return std::nullopt;
+        bytes.resize(length + 65536);
+      }
+      const ssize_t got = ::read(file.get(), bytes.data() + length, bytes.size() - length);
+      if (got < 0 && errno == EINTR) continue;
+      if (got < 0) return std::nullopt;
+      if (got == 0) break;
+      length += static_cast<std::size_t>(got);
+    }
+    if (length > limit) return std::nullopt;
+    bytes.resize(length);
+    return bytes;
+  } catch (const std::bad_alloc&) {
+    return std::nullopt;
+  }
+}
+
+bool LinuxFileManager::writeFileAtomically(const std::string& path, std::string_view bytes) noexcept {
+  return guarded([&] {
+           Place place;
+           if (const int error = Place::open(path, &place); error != 0) return error;
+           struct stat there {};
+           const bool keep =
+               ::fstatat(place.directory.get(), place.name.c_str(), &there, AT_SYMLINK_NOFOLLOW) == 0 &&
+               S_ISREG(there.st_mode);
+           Stage stage(place);
+           if (const int error = stage.makeFile(); error != 0) return error;
+           if (const int error = writeAll(stage.get(), bytes); error != 0) return error;
+           mode_t mode = 0644;
+           if (keep) {
+             mode = there.st_mode & 0777;
+             if (::fchown(stage.get(), there.st_uid, there.st_gid) != 0) mode &= 0700;
+           }
+           if (::fchmod(stage.get(), mode) != 0 || ::fdatasync(stage.get()) != 0) return errno;
+           if (const int error = stage.publish(IfPresent::replaceNonDirectory); error != 0) return error;
+           // The name is as durable as the bytes only once its directory is.
+           const UniqueFd directory(::openat(place.directory.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+           return directory.isValid() && ::fsync(directory.get()) == 0 ? 0 : errno;
+         })
+      .succeeded();
+}
+
+bool LinuxFileManager::writeFile(const std::string& path, std::string_view bytes) noexcept {
+  return guarded([&] {
+           const UniqueFd file(::open(
+               path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644));
+           if (!file.isValid()) return errno;
+           return writeAll(file.get(), bytes);
+         })
+      .succeeded();
+}
+
+}  // namespace brenvik

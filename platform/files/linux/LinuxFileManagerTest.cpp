@@ -1,0 +1,595 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/files/linux/LinuxFileManager.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/file.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <csignal>
+#include <cstring>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/files/fakes/ChildProcesses.h"
+#include "platform/files/fakes/TemporaryDirectory.h"
+
+namespace brenvik {
+namespace {
+
+constexpr FileOutcome kSuccess = FileOutcome::success();
+
+constexpr FileOutcome failure(int code) { return FileOutcome::failure(code); }
+
+class LinuxFileManagerTest : public testing::Test {
+ protected:
+  FileOutcome copy(const std::string& from, const std::string& to, IfPresent present = IfPresent::fail) {
+    return files.copyItem(dir / from, dir / to, present);
+  }
+  FileOutcome move(const std::string& from, const std::string& to, IfPresent present = IfPresent::fail) {
+    return files.moveItem(dir / from, dir / to, present);
+  }
+  std::vector<std::string> names(const std::string& of) {
+    std::vector<std::string> found;
+    EXPECT_EQ(files.listDirectory(dir / of, &found), kSuccess);
+    std::sort(found.begin(), found.end());
+    return found;
+  }
+
+  TemporaryDirectory dir;
+  LinuxFileManager files;
+};
+
+std::string attributeOf(const std::string& path, const char* name) {
+  char value[256];
+  const ssize_t size = ::getxattr(path.c_str(), name, value, sizeof value);
+  return size < 0 ? "(none)" : std::string(value, static_cast<std::size_t>(size));
+}
+
+void setTimes(const std::string& path, time_t accessed, time_t modified) {
+  const timespec times[2] = {{accessed, 123}, {modified, 456}};
+  ASSERT_EQ(::utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW), 0);
+}
+
+// ---- copies
+
+TEST_F(LinuxFileManagerTest, ACopiedFileHasTheDataTheModeTheTimesAndTheExtendedAttributes) {
+  const std::string source = dir.file("source", std::string("a\0b", 3));
+  ASSERT_EQ(::chmod(source.c_str(), 06741), 0);
+  const bool attributes = ::setxattr(source.c_str(), "user.note", "value", 5, 0) == 0;
+  setTimes(source, 1000, 2000);
+  EXPECT_EQ(copy("source", "copy"), kSuccess);
+  const struct stat info = statOf(dir / "copy");
+  EXPECT_EQ(contentOf(dir / "copy"), std::string("a\0b", 3));
+  EXPECT_EQ(info.st_mode & 07777, 06741u);
+  EXPECT_EQ(info.st_mtim.tv_sec, 2000);
+  EXPECT_EQ(info.st_mtim.tv_nsec, 456);
+  EXPECT_EQ(info.st_atim.tv_sec, 1000);
+  if (attributes) {
+    EXPECT_EQ(attributeOf(dir / "copy", "user.note"), "value");
+  }
+}
+
+TEST_F(LinuxFileManagerTest, TheUmaskAndASetGroupDirectoryChangeNoPromisedMode) {
+  dir.file("tree/file", "x");
+  ASSERT_EQ(::chmod((dir / "tree/file").c_str(), 0666), 0);
+  ASSERT_EQ(::chmod((dir / "tree").c_str(), 0777), 0);
+  dir.directory("to");
+  ASSERT_EQ(::chmod((dir / "to").c_str(), 02755), 0);
+  for (const mode_t mask : {0077u, 0000u, 0777u}) {
+    const mode_t before = ::umask(mask);
+    EXPECT_EQ(copy("tree", "to/tree"), kSuccess);
+    EXPECT_EQ(copy("tree/file", "to/file"), kSuccess);
+    EXPECT_EQ(files.createDirectory(dir / "to/made", {02711, "", ""}, Intermediates::mustExist), kSuccess);
+    ::umask(before);
+    EXPECT_EQ(statOf(dir / "to/tree").st_mode & 07777, 0777u);
+    EXPECT_EQ(statOf(dir / "to/tree/file").st_mode & 07777, 0666u);
+    EXPECT_EQ(statOf(dir / "to/file").st_mode & 07777, 0666u);
+    EXPECT_EQ(statOf(dir / "to/made").st_mode & 07777, 02711u);
+    for (const char* made : {"to/tree", "to/file", "to/made"}) {
+      EXPECT_EQ(files.removeItem(dir / made), kSuccess);
+    }
+  }
+}
+
+TEST_F(LinuxFileManagerTest, ADefaultAccessListAboveChangesNoPromisedMode) {
+  // Version 2; user rwx, a named user rwx, group ---, mask ---, other ---.
+  const unsigned char list[] = {2, 0,  0,   0,   1,   0,   7,  0, 255, 255, 255, 255, 2,   0,  7,
+                                0, 77, 0,   0,   0,   4,   0,  0, 0,   255, 255, 255, 255, 16, 0,
+                                0, 0,  255, 255, 255, 255, 32, 0, 0,   0,   255, 255, 255, 255};
+  dir.file("tree/file", "x");
+  ASSERT_EQ(::chmod((dir / "tree/file").c_str(), 0644), 0);
+  dir.directory("to");
+  if (::setxattr((dir / "to").c_str(), "system.posix_acl_default", list, sizeof list, 0) != 0) {
+    GTEST_SKIP() << "no access lists on this file system";
+  }
+  EXPECT_EQ(copy("tree", "to/tree"), kSuccess);
+  EXPECT_EQ(copy("tree/file", "to/file"), kSuccess);
+  EXPECT_EQ(statOf(dir / "to/tree/file").st_mode & 07777, 0644u);
+  EXPECT_EQ(statOf(dir / "to/file").st_mode & 07777, 0644u);
+  EXPECT_EQ(attributeOf(dir / "to/tree/file", "system.posix_acl_access"), "(none)");
+}
+
+TEST_F(LinuxFileManagerTest, ACopiedTreeKeepsModesTimesLinksFifosAndSockets) {
+  dir.file("tree/sub/file", "x");
+  dir.link("tree/link", "../outside");
+  dir.directory("tree/empty");
+  ASSERT_EQ(::mkfifo((dir / "tree/fifo").c_str(), 0640), 0);
+  ASSERT_EQ(::mknod((dir / "tree/socket").c_str(), S_IFSOCK | 0600, 0), 0);
+  ASSERT_EQ(::chmod((dir / "tree/sub").c_str(), 0500), 0);
+  for (const char* name : {"tree/sub/file", "tree/link", "tree/empty", "tree/fifo", "tree/sub", "tree"}) {
+    setTimes(dir / name, 3000, 4000);
+  }
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  EXPECT_EQ(std::filesystem::read_symlink(dir / "copy/link"), "../outside");
+  EXPECT_EQ(statOf(dir / "copy/fifo").st_mode, S_IFIFO | 0640u);
+  EXPECT_EQ(statOf(dir / "copy/socket").st_mode, S_IFSOCK | 0600u);
+  EXPECT_EQ(statOf(dir / "copy/sub").st_mode, S_IFDIR | 0500u);
+  for (const char* name : {"copy/sub/file", "copy/link", "copy/empty", "copy/fifo", "copy/sub", "copy"}) {
+    EXPECT_EQ(statOf(dir / name).st_mtim.tv_sec, 4000) << name;
+  }
+  EXPECT_EQ(names("copy"), (std::vector<std::string>{"empty", "fifo", "link", "socket", "sub"}));
+  ASSERT_EQ(::chmod((dir / "tree/sub").c_str(), 0700), 0);
+  ASSERT_EQ(::chmod((dir / "copy/sub").c_str(), 0700), 0);
+}
+
+TEST_F(LinuxFileManagerTest, OwnersAreKeptWhereThatIsPermitted) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give files away";
+  dir.file("tree/file", "x");
+  ASSERT_EQ(::chown((dir / "tree/file").c_str(), 4711, 4712), 0);
+  ASSERT_EQ(::chmod((dir / "tree/file").c_str(), 04755), 0);
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  EXPECT_EQ(statOf(dir / "copy/file").st_uid, 4711u);
+  EXPECT_EQ(statOf(dir / "copy/file").st_gid, 4712u);
+  EXPECT_EQ(statOf(dir / "copy/file").st_mode & 07777, 04755u);
+}
+
+TEST_F(LinuxFileManagerTest, AnOrdinaryUsersCopyHasNoSetIdBitOfAnotherOwner) {
+  const std::string source = dir.file("source", "x");
+  ASSERT_EQ(::chmod(dir.path().c_str(), 0777), 0);
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to prepare another's file";
+  ASSERT_EQ(::chmod(source.c_str(), 06755), 0);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    if (::setresgid(4712, 4712, 4712) != 0 || ::setresuid(4711, 4711, 4711) != 0) ::_exit(9);
+    ::_exit(copy("source", "copy").succeeded() ? 0 : 1);
+  }
+  int status = -1;
+  ::waitpid(child, &status, 0);
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(statOf(dir / "copy").st_mode & 07777, 0755u);
+  EXPECT_EQ(statOf(dir / "copy").st_uid, 4711u);
+}
+
+TEST_F(LinuxFileManagerTest, HardLinksInsideATreeStayHardLinks) {
+  dir.file("tree/a", "shared");
+  dir.directory("tree/sub");
+  ASSERT_EQ(::link((dir / "tree/a").c_str(), (dir / "tree/sub/b").c_str()), 0);
+  ASSERT_EQ(::link((dir / "tree/a").c_str(), (dir / "outside").c_str()), 0);
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  EXPECT_EQ(statOf(dir / "copy/a").st_ino, statOf(dir / "copy/sub/b").st_ino);
+  EXPECT_EQ(statOf(dir / "copy/a").st_nlink, 2u);
+  EXPECT_EQ(contentOf(dir / "copy/sub/b"), "shared");
+}
+
+TEST_F(LinuxFileManagerTest, ADirectoryOfManyFilesIsCopiedWholeByTwoThreads) {
+  std::set<std::string> expected;
+  for (int i = 0; i < 500; ++i) {
+    const std::string name = "f" + std::to_string(i);
+    dir.file("tree/" + name, "content of " + name);
+    expected.insert(name);
+  }
+  ASSERT_EQ(::link((dir / "tree/f7").c_str(), (dir / "tree/second").c_str()), 0);
+  files.openScope();
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  files.closeScope();
+  for (const std::string& name : expected) EXPECT_EQ(contentOf(dir / ("copy/" + name)), "content of " + name);
+  EXPECT_EQ(statOf(dir / "copy/f7").st_ino, statOf(dir / "copy/second").st_ino);
+  EXPECT_EQ(names("copy").size(), 501u);
+}
+
+TEST_F(LinuxFileManagerTest, LargeAndSparseFilesAreCopiedByteForByte) {
+  std::string large(3'000'001, '\0');
+  for (std::size_t i = 0; i < large.size(); ++i) large[i] = static_cast<char>(i * 2654435761u >> 13);
+  dir.file("large", large);
+  EXPECT_EQ(copy("large", "large-copy"), kSuccess);
+  EXPECT_TRUE(contentOf(dir / "large-copy") == large);
+
+  const int fd = ::open((dir / "sparse").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
+  ASSERT_EQ(::pwrite(fd, "begin", 5, 0), 5);
+  ASSERT_EQ(::pwrite(fd, "middle", 6, 5 << 20), 6);
+  ASSERT_EQ(::ftruncate(fd, 20 << 20), 0);
+  ::close(fd);
+  EXPECT_EQ(copy("sparse", "sparse-copy"), kSuccess);
+  EXPECT_TRUE(contentOf(dir / "sparse-copy") == contentOf(dir / "sparse"));
+  EXPECT_LT(statOf(dir / "sparse-copy").st_blocks * 512, 2 << 20);
+}
+
+TEST_F(LinuxFileManagerTest, ATreeDeeperThanTheProcessHasDescriptorsIsCopiedListedAndRemoved) {
+  constexpr int kDepth = 1500;
+  const std::string top = dir.directory("deep");
+  int fd = ::open(top.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  for (int i = 0; i < kDepth; ++i) {
+    ASSERT_EQ(::mkdirat(fd, "d", 0755), 0);
+    const int next = ::openat(fd, "d", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    ::close(fd);
+    fd = next;
+  }
+  ASSERT_EQ(::symlinkat("bottom", fd, "end"), 0);
+  ::close(fd);
+  EXPECT_EQ(copy("deep", "copy"), kSuccess);
+  struct Counter final : ItemVisitor {
+    int count = 0;
+    std::string last;
+    Next visit(const std::string& subpath, bool) noexcept override {
+      ++count;
+      last = subpath.substr(subpath.rfind('/') + 1);
+      return Next::descend;
+    }
+  } counter;
+  EXPECT_EQ(files.enumerateBelow(dir / "copy", counter), kSuccess);
+  EXPECT_EQ(counter.count, kDepth + 1);
+  EXPECT_EQ(counter.last, "end");
+  EXPECT_EQ(files.removeItem(dir / "deep"), kSuccess);
+  EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
+  EXPECT_TRUE(names("").empty());
+}
+
+TEST_F(LinuxFileManagerTest, DevicesAreRefusedAndLeaveNothingBehind) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to make a device node";
+  dir.file("tree/file", "x");
+  if (::mknod((dir / "tree/null").c_str(), S_IFCHR | 0666, makedev(1, 3)) != 0)
+    GTEST_SKIP() << "no nodes here";
+  EXPECT_EQ(copy("tree", "copy"), failure(EPERM));
+  EXPECT_EQ(copy("tree/null", "null"), failure(EPERM));
+  EXPECT_EQ(names(""), (std::vector<std::string>{"tree"}));
+}
+
+TEST_F(LinuxFileManagerTest, ACopyFailsWithEExistWhenAnythingIsThere) {
+  dir.file("file", "new");
+  dir.file("there", "old");
+  dir.directory("directory");
+  dir.link("dangling", "nowhere");
+  for (const char* destination : {"there", "directory", "dangling", "directory/", ".", "directory/.."}) {
+    EXPECT_EQ(copy("file", destination), failure(EEXIST)) << destination;
+  }
+  EXPECT_EQ(copy("directory", "there"), failure(EEXIST));
+  EXPECT_EQ(contentOf(dir / "there"), "old");
+  EXPECT_EQ(copy("file", "no/such/place"), failure(ENOENT));
+  EXPECT_EQ(copy("file", "there/below"), failure(ENOTDIR));
+  EXPECT_EQ(copy("missing", "new"), failure(ENOENT));
+  EXPECT_EQ(files.copyItem(dir / "file", "", IfPresent::fail), failure(ENOENT));
+  EXPECT_EQ(files.copyItem(dir / "file", "/", IfPresent::fail), failure(EEXIST));
+}
+
+TEST_F(LinuxFileManagerTest, AReplacingCopyTakesTheNameOfAFileOrALinkButNotOfADirectory) {
+  dir.file("file", "new");
+  dir.file("tree/below", "tree");
+  dir.file("precious", "kept");
+  dir.link("link", "precious");
+  dir.directory("directory");
+  EXPECT_EQ(copy("file", "link", IfPresent::replaceNonDirectory), kSuccess);
+  EXPECT_TRUE(S_ISREG(statOf(dir / "link").st_mode));
+  EXPECT_EQ(contentOf(dir / "precious"), "kept");
+  EXPECT_EQ(copy("file", "directory", IfPresent::replaceNonDirectory), failure(EEXIST));
+  EXPECT_EQ(copy("tree", "directory", IfPresent::replaceNonDirectory), failure(EEXIST));
+  EXPECT_EQ(copy("tree", "precious", IfPresent::replaceNonDirectory), kSuccess);
+  EXPECT_EQ(contentOf(dir / "precious/below"), "tree");
+  dir.link("source-link", "elsewhere");
+  EXPECT_EQ(copy("source-link", "link", IfPresent::replaceNonDirectory), kSuccess);
+  EXPECT_EQ(std::filesystem::read_symlink(dir / "link"), "elsewhere");
+  EXPECT_EQ(names(""),
+            (std::vector<std::string>{"directory", "file", "link", "precious", "source-link", "tree"}));
+}
+
+TEST_F(LinuxFileManagerTest, ADirectoryCannotComeToStandInsideItself) {
+  dir.file("tree/sub/file", "x");
+  dir.link("alias", "tree/sub");
+  for (const char* destination : {"tree/copy", "tree/sub/copy", "alias/copy"}) {
+    EXPECT_EQ(copy("tree", destination), failure(EINVAL)) << destination;
+    EXPECT_EQ(move("tree", destination), failure(EINVAL)) << destination;
+  }
+  EXPECT_EQ(names("tree"), (std::vector<std::string>{"sub"}));
+  EXPECT_EQ(copy("tree", "tree-copy"), kSuccess);
+}
+
+TEST_F(LinuxFileManagerTest, WhatAKilledCopyLeftIsClearedByTheNextAndALivingOnesIsNot) {
+  dir.file("tree/file", "x");
+  // The stage's name follows from the destination's: have a copy leave it behind.
+  const std::string stage = [&] {
+    const pid_t child = ::fork();
+    if (child == 0) {
+      // The first byte written is its end: between staging and publishing.
+      const rlimit none{0, 0};
+      ::setrlimit(RLIMIT_CORE, &none);
+      ::setrlimit(RLIMIT_FSIZE, &none);
+      (void)copy("tree", "copy");
+      ::_exit(0);
+    }
+    int status = 0;
+    ::waitpid(child, &status, 0);
+    EXPECT_TRUE(WIFSIGNALED(status));
+    std::string left;
+    for (const std::string& name : names("")) {
+      if (name.starts_with(".brenvik-")) left = name;
+    }
+    return left;
+  }();
+  ASSERT_FALSE(stage.empty());
+  EXPECT_FALSE(isThere(dir / "copy"));
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  EXPECT_EQ(names(""), (std::vector<std::string>{"copy", "tree"}));
+
+  // The same name, held by somebody who lives.
+  EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
+  dir.file(stage + "/theirs", "kept");
+  const UniqueFd held(::open((dir / stage).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  ASSERT_EQ(::flock(held.get(), LOCK_EX | LOCK_NB), 0);
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  EXPECT_EQ(contentOf(dir / (stage + "/theirs")), "kept");
+  EXPECT_EQ(contentOf(dir / "copy/file"), "x");
+}
+
+// ---- moves
+
+TEST_F(LinuxFileManagerTest, AMoveInsideOneFileSystemKeepsTheInode) {
+  dir.file("tree/file", "x");
+  const ino_t before = statOf(dir / "tree").st_ino;
+  EXPECT_EQ(move("tree", "moved"), kSuccess);
+  EXPECT_EQ(statOf(dir / "moved").st_ino, before);
+  EXPECT_FALSE(isThere(dir / "tree"));
+}
+
+TEST_F(LinuxFileManagerTest, AMoveFailsWithEExistWhenAnythingIsThere) {
+  dir.file("file", "new");
+  dir.directory("empty");
+  dir.link("dangling", "nowhere");
+  EXPECT_EQ(move("file", "empty"), failure(EEXIST));
+  EXPECT_EQ(move("file", "dangling"), failure(EEXIST));
+  EXPECT_EQ(move("empty", "file"), failure(EEXIST));
+  EXPECT_EQ(move("missing", "new"), failure(ENOENT));
+  EXPECT_EQ(contentOf(dir / "file"), "new");
+}
+
+TEST_F(LinuxFileManagerTest, AReplacingMoveTakesTheNameOfAFileOrALinkButNotOfADirectory) {
+  dir.file("file", "new");
+  dir.file("there", "old");
+  dir.file("tree/below", "tree");
+  dir.directory("directory");
+  EXPECT_EQ(move("file", "directory", IfPresent::replaceNonDirectory), failure(EEXIST));
+  EXPECT_EQ(move("file", "there", IfPresent::replaceNonDirectory), kSuccess);
+  EXPECT_EQ(contentOf(dir / "there"), "new");
+  EXPECT_EQ(move("tree", "there", IfPresent::replaceNonDirectory), kSuccess);
+  EXPECT_EQ(contentOf(dir / "there/below"), "tree");
+  EXPECT_EQ(names(""), (std::vector<std::string>{"directory", "there"}));
+}
+
+TEST_F(LinuxFileManagerTest, TwoNamesOfOneFileBecomeOneAndOneNameStays) {
+  const std::string first = dir.file("first", "x");
+  ASSERT_EQ(::link(first.c_str(), (dir / "second").c_str()), 0);
+  EXPECT_EQ(move("first", "second", IfPresent::replaceNonDirectory), kSuccess);
+  EXPECT_EQ(names(""), (std::vector<std::string>{"second"}));
+  EXPECT_EQ(move("second", "./second", IfPresent::replaceNonDirectory), kSuccess);
+  EXPECT_EQ(contentOf(dir / "second"), "x");
+}
+
+TEST_F(LinuxFileManagerTest, AMoveBetweenTwoMountsCopiesThenRemovesTheSource) {
+  dir.file("tree/sub/file", "x");
+  ASSERT_EQ(::chmod((dir / "tree/sub").c_str(), 0711), 0);
+  dir.link("tree/link", "target");
+  dir.file("single", "s");
+  dir.directory("disk");
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 1024);
+    EXPECT_EQ(move("tree", "disk/tree"), kSuccess);
+    EXPECT_EQ(contentOf(dir / "disk/tree/sub/file"), "x");
+    EXPECT_EQ(statOf(dir / "disk/tree/sub").st_mode & 07777, 0711u);
+    EXPECT_EQ(std::filesystem::read_symlink(dir / "disk/tree/link"), "target");
+    EXPECT_FALSE(isThere(dir / "tree"));
+    dir.file("disk/single", "old");
+    EXPECT_EQ(move("single", "disk/single"), failure(EEXIST));
+    EXPECT_EQ(move("single", "disk/single", IfPresent::replaceNonDirectory), kSuccess);
+    EXPECT_EQ(contentOf(dir / "disk/single"), "s");
+    EXPECT_FALSE(isThere(dir / "single"));
+    EXPECT_EQ(names("disk"), (std::vector<std::string>{"single", "tree"}));
+  });
+}
+
+// ---- a full disk
+
+TEST_F(LinuxFileManagerTest, OnAFullDiskACopyLeavesTheOldFileAndNothingElse) {
+  dir.file("big", std::string(200'000, 'b'));
+  dir.file("tree/a", std::string(40'000, 'a'));
+  dir.file("tree/b", std::string(90'000, 'b'));
+  dir.directory("disk");
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 100);
+    dir.file("disk/big", "old");
+    EXPECT_EQ(copy("big", "disk/big", IfPresent::replaceNonDirectory), failure(ENOSPC));
+    EXPECT_EQ(contentOf(dir / "disk/big"), "old");
+    EXPECT_EQ(copy("big", "disk/new"), failure(ENOSPC));
+    EXPECT_EQ(copy("tree", "disk/tree"), failure(ENOSPC));
+    EXPECT_EQ(move("tree", "disk/tree"), failure(ENOSPC));
+    EXPECT_EQ(names("disk"), (std::vector<std::string>{"big"}));
+    EXPECT_EQ(statOf(dir / "tree/b").st_size, 90'000);
+    EXPECT_FALSE(files.writeFileAtomically(dir / "disk/big", std::string(200'000, 'n')));
+    EXPECT_EQ(contentOf(dir / "disk/big"), "old");
+    EXPECT_EQ(names("disk"), (std::vector<std::string>{"big"}));
+  });
+}
+
+TEST_F(LinuxFileManagerTest, WhereWritingIsForbiddenNothingChanges) {
+  if (::geteuid() != 0) GTEST_SKIP() << "becomes another user";
+  dir.file("file", "new");
+  dir.file("locked/file", "old");
+  ASSERT_EQ(::chmod(dir.path().c_str(), 0755), 0);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    if (::setresgid(4712, 4712, 4712) != 0 || ::setresuid(4711, 4711, 4711) != 0) ::_exit(9);
+    EXPECT_EQ(copy("file", "locked/file", IfPresent::replaceNonDirectory), failure(EACCES));
+    EXPECT_EQ(copy("file", "locked/new"), failure(EACCES));
+    EXPECT_EQ(move("file", "locked/file", IfPresent::replaceNonDirectory), failure(EACCES));
+    EXPECT_EQ(files.removeItem(dir / "locked"), failure(EACCES));
+    EXPECT_EQ(files.createDirectory(dir / "locked/new", {}, Intermediates::mustExist), failure(EACCES));
+    EXPECT_FALSE(files.writeFileAtomically(dir / "locked/file", "new"));
+    EXPECT_FALSE(files.writeFile(dir / "locked/file", "new"));
+    ::_exit(testing::Test::HasFailure() ? 1 : 0);
+  }
+  int status = -1;
+  ::waitpid(child, &status, 0);
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(contentOf(dir / "locked/file"), "old");
+  EXPECT_EQ(names("locked"), (std::vector<std::string>{"file"}));
+}
+
+// ---- removal and listing
+
+TEST_F(LinuxFileManagerTest, RemovalDoesNotFollowLinksAndGoesOnPastWhatStays) {
+  dir.file("outside/file", "kept");
+  dir.file("tree/sub/file", "x");
+  dir.link("tree/link", dir / "outside");
+  EXPECT_EQ(files.removeItem(dir.link("alias", "outside")), kSuccess);
+  EXPECT_EQ(files.removeItem(dir / "tree"), kSuccess);
+  EXPECT_EQ(contentOf(dir / "outside/file"), "kept");
+  EXPECT_EQ(files.removeItem(dir / "tree"), failure(ENOENT));
+  if (::geteuid() != 0) return;
+  dir.file("tree/a/file", "x");
+  dir.directory("tree/held");
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "tree/held", 64);
+    EXPECT_EQ(files.removeItem(dir / "tree"), failure(EBUSY));
+    EXPECT_EQ(names("tree"), (std::vector<std::string>{"held"}));
+  });
+}
+
+TEST_F(LinuxFileManagerTest, TheVisitorMaySkipAndMayTakeItemsAway) {
+  dir.file("tree/keep/file", "x");
+  dir.file("tree/skip/file", "x");
+  dir.file("tree/gone/file", "x");
+  dir.link("tree/link", "keep");
+  struct Visitor final : ItemVisitor {
+    const TemporaryDirectory& dir;
+    std::set<std::string> seen;
+    explicit Visitor(const TemporaryDirectory& d) : dir(d) {}
+    Next visit(const std::string& subpath, bool isDirectory) noexcept override {
+      seen.insert(subpath + (isDirectory ? "/" : ""));
+      if (subpath == "gone") std::filesystem::remove_all(dir / "tree/gone");
+      return subpath == "skip" ? Next::skipBelow : Next::descend;
+    }
+  } visitor(dir);
+  EXPECT_EQ(files.enumerateBelow(dir / "tree", visitor), kSuccess);
+  EXPECT_EQ(visitor.seen, (std::set<std::string>{"keep/", "keep/file", "skip/", "gone/", "link"}));
+  EXPECT_EQ(files.enumerateBelow(dir / "missing", visitor), failure(ENOENT));
+  EXPECT_EQ(files.enumerateBelow(dir / "tree/keep/file", visitor), failure(ENOTDIR));
+}
+
+// ---- attributes
+
+TEST_F(LinuxFileManagerTest, AttributesGoToALinkItselfOrNotAtAll) {
+  const std::string file = dir.file("file");
+  ASSERT_EQ(::chmod(file.c_str(), 0600), 0);
+  const std::string link = dir.link("link", "file");
+  dir.link("dangling", "nowhere");
+  EXPECT_EQ(files.setAttributes(link, {0777, {}, {}}), kSuccess);
+  EXPECT_EQ(statOf(file).st_mode & 07777, 0600u);
+  EXPECT_EQ(files.setAttributes(dir / "dangling", {0777, ::getuid(), ::getgid()}), kSuccess);
+  EXPECT_EQ(files.setAttributes(dir / "missing", {0777, {}, {}}), failure(ENOENT));
+  EXPECT_EQ(files.setAttributes(dir / "missing", {{}, 0, 0}), failure(ENOENT));
+  EXPECT_EQ(files.setAttributes(file, {0644, {}, {}}), kSuccess);
+  EXPECT_EQ(statOf(file).st_mode & 07777, 0644u);
+}
+
+TEST_F(LinuxFileManagerTest, NamedOwnersAreLookedUp) {
+  EXPECT_EQ(files.createDirectory(dir / "a", {0755, "root", "root"}, Intermediates::mustExist),
+            ::geteuid() == 0 ? kSuccess : failure(EPERM));
+  EXPECT_EQ(files.createDirectory(dir / "b", {0755, "", "no such group"}, Intermediates::mustExist),
+            failure(EINVAL));
+  EXPECT_FALSE(isThere(dir / "b"));
+}
+
+// ---- reading and writing
+
+TEST_F(LinuxFileManagerTest, ReadingStopsAtTheLimitAndNeverWaits) {
+  dir.file("file", "12345");
+  EXPECT_EQ(files.readFile(dir / "file", 5), "12345");
+  EXPECT_EQ(files.readFile(dir / "file", 4), std::nullopt);
+  EXPECT_NE(files.readFile("/proc/self/status", 1 << 20), std::nullopt);  // says it is empty, and is not
+  EXPECT_EQ(files.readFile("/proc/self/status", 10), std::nullopt);
+  EXPECT_EQ(files.readFile(dir.path(), 10), std::nullopt);
+  ASSERT_EQ(::mkfifo((dir / "fifo").c_str(), 0600), 0);
+  EXPECT_EQ(files.readFile(dir / "fifo", 10), std::nullopt);
+}
+
+TEST_F(LinuxFileManagerTest, AnAtomicWriteReplacesALinkAndNotItsTarget) {
+  dir.file("precious", "kept");
+  dir.link("link", "precious");
+  EXPECT_TRUE(files.writeFileAtomically(dir / "link", "new"));
+  EXPECT_EQ(contentOf(dir / "link"), "new");
+  EXPECT_EQ(contentOf(dir / "precious"), "kept");
+  EXPECT_TRUE(files.writeFileAtomically(dir / "fresh", ""));
+  EXPECT_EQ(statOf(dir / "fresh").st_mode & 07777, 0644u);
+  EXPECT_FALSE(files.writeFileAtomically(dir / "no/such", "x"));
+  EXPECT_FALSE(files.writeFileAtomically(dir.directory("directory"), "x"));
+  EXPECT_EQ(names(""), (std::vector<std::string>{"directory", "fresh", "link", "precious"}));
+}
+
+TEST_F(LinuxFileManagerTest, AWriteInPlaceRefusesALinkAndDoesNotWaitForAReader) {
+  dir.file("precious", "kept");
+  dir.link("link", "precious");
+  EXPECT_FALSE(files.writeFile(dir / "link", "new"));
+  EXPECT_EQ(contentOf(dir / "precious"), "kept");
+  EXPECT_TRUE(files.writeFile(dir / "precious", "new"));
+  EXPECT_EQ(contentOf(dir / "precious"), "new");
+  ASSERT_EQ(::mkfifo((dir / "fifo").c_str(), 0600), 0);
+  EXPECT_FALSE(files.writeFile(dir / "fifo", "x"));
+}
+
+// ---- killed at any moment
+
+TEST_F(LinuxFileManagerTest, KilledAtAnyMomentTheOldFileOrTheNewOneStandsAndNeverHalf) {
+  const std::string oldContent(300'000, 'o');
+  const std::string newContent(300'000, 'n');
+  dir.file("old", oldContent);
+  dir.file("new", newContent);
+  dir.file("tree/a", newContent);
+  dir.file("tree/b", newContent);
+  dir.directory("work");
+  for (int round = 0; round < 40; ++round) {
+    dir.file("work/file", oldContent);
+    const pid_t child = ::fork();
+    if (child == 0) {
+      killThisProcessAfter(std::chrono::microseconds(500 + round * 173));
+      for (;;) {
+        (void)copy("new", "work/file", IfPresent::replaceNonDirectory);
+        (void)files.writeFileAtomically(dir / "work/file", oldContent);
+        (void)copy("tree", "work/tree");
+        (void)files.removeItem(dir / "work/tree/b");
+        (void)copy("new", "work/tree/b");
+        (void)move("work/tree", "work/second");
+        (void)files.removeItem(dir / "work/second");
+      }
+    }
+    ::waitpid(child, nullptr, 0);
+    const std::string after = contentOf(dir / "work/file");
+    ASSERT_TRUE(after == oldContent || after == newContent) << "round " << round << ": " << after.size();
+    for (const char* name : {"work/tree/a", "work/tree/b", "work/second/a", "work/second/b"}) {
+      if (isThere(dir / name)) {
+        ASSERT_EQ(contentOf(dir / name).size(), newContent.size()) << name;
+      }
+    }
+    std::filesystem::remove_all(dir / "work");
+    dir.directory("work");
+  }
+}
+
+}  // namespace
+}  // namespace brenvik

@@ -1,0 +1,56 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <sys/stat.h>
+
+#include <map>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/files/linux/FileContents.h"
+
+namespace brenvik {
+
+// Copies items from one directory into another, under names that must not exist there. Links stay links, hard
+// links within one item stay hard links, FIFOs and sockets are made anew; device nodes are refused (EPERM).
+// Stops at the first failure and leaves what was made to the caller. One thread; the functions may throw
+// std::bad_alloc.
+class TreeCopier {
+ public:
+  // The owner of a file that this process makes, so that most files need no change of owner.
+  TreeCopier(FileContents& contents, uid_t ownUid, gid_t ownGid)
+      : contents_(contents), ownUid_(ownUid), ownGid_(ownGid) {}
+
+  // Copies the regular file, its attributes included, into a file just made. 0 or errno.
+  int copyFileInto(int source, const struct stat& info, int destination);
+
+  // Copies everything in the directory `source` into the empty directory `destination` (mode 0700 and owned
+  // by this process), then gives it the attributes of the source. 0 or errno.
+  int copyDirectoryInto(int source, const struct stat& info, int destination);
+
+  // Copies the link, FIFO or socket `name`. `info`: of the item itself. 0 or errno.
+  int copySpecial(int sourceDirectory, const char* name, const struct stat& info, int destinationDirectory,
+                  const char* destinationName);
+
+ private:
+  struct Level;
+  struct Share;
+
+  void learnUmask(int directory);
+  // What both threads run: copies files of the share until there are none left or one failed.
+  int workOn(Share& share, FileContents& contents, std::vector<const char*>* severalNames) const;
+  int copyRegular(FileContents& contents, int from, int to, const char* name, bool* hasSeveralNames) const;
+  int copyAgain(int from, int to, const char* name, const std::string& pathHere, int top);
+  // Everything in the level's directory but the directories.
+  int copyEntries(Level& level, const std::string& pathHere, int top);
+
+  FileContents& contents_;
+  const uid_t ownUid_;
+  const gid_t ownGid_;
+  mode_t umask_ = 0777;                                    // what creation takes from a mode
+  std::map<std::pair<dev_t, ino_t>, std::string> linked_;  // files with several names: the first copy's path
+};
+
+}  // namespace brenvik

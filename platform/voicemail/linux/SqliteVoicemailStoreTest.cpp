@@ -1,0 +1,254 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/voicemail/linux/SqliteVoicemailStore.h"
+
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <memory>
+#include <string>
+
+#include "platform/files/fakes/ChildProcesses.h"
+#include "platform/files/fakes/TemporaryDirectory.h"
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/voicemail/fakes/InMemoryVoicemailStore.h"
+#include "platform/voicemail/linux/DynamicVisualVoicemail.h"
+
+namespace brenvik {
+namespace {
+
+// ---- what every store does
+
+struct SqliteAtHome {
+  TemporaryDirectory home;
+  std::unique_ptr<VoicemailStore> make() {
+    return std::make_unique<SqliteVoicemailStore>(home.path(), ::getuid(), ::getgid());
+  }
+};
+struct InMemory {
+  std::unique_ptr<VoicemailStore> make() { return std::make_unique<InMemoryVoicemailStore>(); }
+};
+
+template <typename Maker>
+class VoicemailStoreContract : public testing::Test {
+ protected:
+  Maker maker;
+  std::unique_ptr<VoicemailStore> store = maker.make();
+};
+using Stores = testing::Types<InMemory, SqliteAtHome>;
+TYPED_TEST_SUITE(VoicemailStoreContract, Stores);
+
+TYPED_TEST(VoicemailStoreContract, AnEmptyStoreHasNoTokens) {
+  EXPECT_EQ(this->store->copyToken(), std::nullopt);
+  EXPECT_EQ(this->store->copyTokenForKey("key"), std::nullopt);
+  EXPECT_EQ(this->store->copyTokenForKey(""), std::nullopt);
+}
+
+TYPED_TEST(VoicemailStoreContract, TokensAreKeptReplacedAndCleared) {
+  const std::string first = "first";
+  const std::string second = "sécond 'quoted' \xF0\x9F\x98\x80";
+  this->store->setToken(&first);
+  this->store->setToken(&second);
+  this->store->setTokenForKey("a", "1");
+  this->store->setTokenForKey("a", "2");
+  this->store->setTokenForKey("", "empty key");
+  this->store->setTokenForKey("b", "");
+  EXPECT_EQ(this->store->copyToken(), second);
+  EXPECT_EQ(this->store->copyTokenForKey("a"), "2");
+  EXPECT_EQ(this->store->copyTokenForKey(""), "empty key");
+  EXPECT_EQ(this->store->copyTokenForKey("b"), "");
+  EXPECT_EQ(this->store->copyTokenForKey("A"), std::nullopt);
+  this->store->setToken(nullptr);
+  EXPECT_EQ(this->store->copyToken(), std::nullopt);
+  EXPECT_EQ(this->store->copyTokenForKey("a"), "2");
+}
+
+TYPED_TEST(VoicemailStoreContract, RemovingAllRecordsKeepsTheGeneralToken) {
+  const std::string token = "general";
+  this->store->setToken(&token);
+  this->store->setTokenForKey("a", "1");
+  this->store->removeAllRecords();
+  this->store->removeAllRecords();
+  EXPECT_EQ(this->store->copyTokenForKey("a"), std::nullopt);
+  EXPECT_EQ(this->store->copyToken(), token);
+}
+
+// ---- on the disk
+
+class SqliteVoicemailStoreTest : public testing::Test {
+ protected:
+  TemporaryDirectory home;
+  std::string file = home / "Library/Voicemail/voicemail.db";
+  SqliteVoicemailStore store{home.path(), ::getuid(), ::getgid()};
+  const std::string token = "token";
+};
+
+TEST_F(SqliteVoicemailStoreTest, ReadingMakesNothingAndWritingMakesAPrivateFileOfTheAccount) {
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  EXPECT_FALSE(isThere(home / "Library"));
+  const uid_t owner = ::geteuid() == 0 ? 4711 : ::getuid();
+  const gid_t group = ::geteuid() == 0 ? 4712 : ::getgid();
+  const mode_t before = ::umask(0);
+  SqliteVoicemailStore of(home.path(), owner, group);
+  of.setToken(&token);
+  ::umask(before);
+  EXPECT_EQ(of.copyToken(), token);
+  EXPECT_EQ(statOf(file).st_mode, S_IFREG | 0600u);
+  EXPECT_EQ(statOf(file).st_uid, owner);
+  EXPECT_EQ(statOf(file).st_gid, group);
+  EXPECT_EQ(statOf(home / "Library/Voicemail").st_mode, S_IFDIR | 0700u);
+  EXPECT_EQ(statOf(home / "Library/Voicemail").st_uid, owner);
+  EXPECT_EQ(statOf(home / "Library").st_mode, S_IFDIR | 0755u);
+}
+
+TEST_F(SqliteVoicemailStoreTest, AnotherObjectSeesWhatWasSet) {
+  store.setToken(&token);
+  SqliteVoicemailStore second(home.path(), ::getuid(), ::getgid());
+  EXPECT_EQ(second.copyToken(), token);
+}
+
+TEST_F(SqliteVoicemailStoreTest, AHomeBehindALinkIsTheSameHome) {
+  TemporaryDirectory other;
+  SqliteVoicemailStore linked(other.link("home", home.path()), ::getuid(), ::getgid());
+  linked.setToken(&token);
+  EXPECT_EQ(store.copyToken(), token);
+}
+
+TEST_F(SqliteVoicemailStoreTest, WithoutAHomeTheStoreIsAlwaysEmpty) {
+  RecordingLog log;
+  for (const std::string& none : {std::string(), home / "missing"}) {
+    SqliteVoicemailStore without(none, 0, 0);
+    without.setToken(&token);
+    without.removeAllRecords();
+    EXPECT_EQ(without.copyToken(), std::nullopt);
+  }
+  EXPECT_FALSE(isThere(home / "missing"));
+}
+
+TEST_F(SqliteVoicemailStoreTest, NoLinkInTheAccountsOwnFoldersIsFollowed) {
+  TemporaryDirectory elsewhere;
+  RecordingLog log;
+  elsewhere.file("victim", "kept");
+  home.link("Library/Voicemail/voicemail.db", elsewhere / "victim");
+  store.setToken(&token);
+  EXPECT_EQ(contentOf(elsewhere / "victim"), "kept");
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  std::filesystem::remove_all(home / "Library/Voicemail");
+  home.link("Library/Voicemail", elsewhere.path());
+  store.setToken(&token);
+  EXPECT_FALSE(isThere(elsewhere / "voicemail.db"));
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+}
+
+TEST_F(SqliteVoicemailStoreTest, ADamagedStoreIsMovedAsideAndANewOneMade) {
+  store.setToken(&token);
+  home.file("Library/Voicemail/voicemail.db", std::string(8192, 'x'));
+  RecordingLog log;
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  store.setTokenForKey("key", "value");
+  EXPECT_EQ(store.copyTokenForKey("key"), "value");
+  EXPECT_EQ(contentOf(file + ".damaged"), std::string(8192, 'x'));
+  EXPECT_EQ(log.entries(),
+            (std::vector{RecordingLog::unifiedLine(
+                LogLevel::error, "The voicemail store is damaged; moved aside to voicemail.db.damaged")}));
+}
+
+TEST_F(SqliteVoicemailStoreTest, ATriggerPlantedByTheAccountsUserDoesNotRun) {
+  store.setTokenForKey("a", "1");
+  sqlite3* handle = nullptr;
+  ASSERT_EQ(::sqlite3_open(file.c_str(), &handle), SQLITE_OK);
+  ASSERT_EQ(::sqlite3_exec(handle, "CREATE TRIGGER t AFTER INSERT ON tokens BEGIN DELETE FROM tokens; END;",
+                           nullptr, nullptr, nullptr),
+            SQLITE_OK);
+  ::sqlite3_close(handle);
+  store.setTokenForKey("b", "2");
+  EXPECT_EQ(store.copyTokenForKey("a"), "1");
+  EXPECT_EQ(store.copyTokenForKey("b"), "2");
+}
+
+TEST_F(SqliteVoicemailStoreTest, AStoreThatAnotherProcessHoldsDropsTheWriteAfterASecondAndStaysSound) {
+  store.setToken(&token);
+  sqlite3* handle = nullptr;
+  ASSERT_EQ(::sqlite3_open(file.c_str(), &handle), SQLITE_OK);
+  ASSERT_EQ(::sqlite3_exec(handle, "BEGIN EXCLUSIVE", nullptr, nullptr, nullptr), SQLITE_OK);
+  RecordingLog log;
+  const std::string other = "other";
+  const auto start = std::chrono::steady_clock::now();
+  store.setToken(&other);
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(10));
+  EXPECT_EQ(
+      log.entries(),
+      (std::vector{RecordingLog::unifiedLine(LogLevel::error, "The voicemail store could not be written")}));
+  ::sqlite3_close(handle);
+  EXPECT_EQ(store.copyToken(), token);
+}
+
+TEST_F(SqliteVoicemailStoreTest, OnAFullDiskTheOldTokenIsStillRead) {
+  home.directory("disk");
+  inPrivateMounts([&] {
+    mountSmallDisk(home / "disk", 64);
+    SqliteVoicemailStore small(home / "disk", ::getuid(), ::getgid());
+    small.setToken(&token);
+    EXPECT_EQ(small.copyToken(), token);
+    home.file("disk/filler", std::string(64 << 10, 'f'));
+    const std::string large(250, 'l');
+    for (int i = 0; i < 60; ++i) small.setTokenForKey("key" + std::to_string(i), large);
+    EXPECT_EQ(small.copyTokenForKey("key59"), std::nullopt);
+    EXPECT_EQ(small.copyToken(), token);
+    std::filesystem::remove(home / "disk/filler");
+    small.setTokenForKey("key", "fits again");
+    EXPECT_EQ(small.copyTokenForKey("key"), "fits again");
+  });
+}
+
+TEST_F(SqliteVoicemailStoreTest, KilledAtAnyMomentItOpensAndHoldsEveryTokenWhoseSetWasAnswered) {
+  int answered = -1;
+  int last = 0;
+  for (int round = 0; round < 15; ++round) {
+    int channel[2];
+    ASSERT_EQ(::pipe(channel), 0);
+    const pid_t child = ::fork();
+    if (child == 0) {
+      killThisProcessAfter(std::chrono::microseconds(20'000 + round * 15'013));
+      for (int i = last;; ++i) {
+        store.setTokenForKey("key" + std::to_string(i % 50), std::to_string(i));
+        if (::write(channel[1], &i, sizeof i) != sizeof i) ::_exit(1);
+      }
+    }
+    ::close(channel[1]);
+    for (int i = 0; ::read(channel[0], &i, sizeof i) == sizeof i;) answered = i;
+    ::close(channel[0]);
+    ::waitpid(child, nullptr, 0);
+    if (answered >= 0) {
+      for (int i = std::max(0, answered - 48); i <= answered; ++i) {
+        ASSERT_EQ(store.copyTokenForKey("key" + std::to_string(i % 50)), std::to_string(i));
+      }
+    }
+    last = answered + 1;
+  }
+  EXPECT_GT(answered, 0);
+}
+
+// ---- the subscription query
+
+TEST(DynamicVisualVoicemailTest, TheQueryIsFoundUnderItsNameWithTheUnderscore) {
+  DynamicVisualVoicemail library(BRENVIK_TEST_LIBRARY, "_VisualVoicemailIsSubscribed");
+  const SubscriptionQuery query = library.lookUpSubscriptionQuery();
+  ASSERT_NE(query, nullptr);
+  EXPECT_TRUE(query());
+}
+
+TEST(DynamicVisualVoicemailTest, AMissingLibraryOrSymbolGivesNoQuery) {
+  EXPECT_EQ(DynamicVisualVoicemail("libno-such-library.so.0", "_x").lookUpSubscriptionQuery(), nullptr);
+  EXPECT_EQ(
+      DynamicVisualVoicemail(BRENVIK_TEST_LIBRARY, "VisualVoicemailIsSubscribed").lookUpSubscriptionQuery(),
+      nullptr);
+  EXPECT_EQ(DynamicVisualVoicemail("", "main").lookUpSubscriptionQuery(), nullptr);
+}
+
+}  // namespace
+}  // namespace brenvik
