@@ -3,6 +3,7 @@
 #pragma once
 
 #include "Helper/Shared/Server/HelperServerUtils.h"
+#include "helper/carrier/CarrierOperations.h"
 #include "helper/core/UnbuiltRoutines.h"
 #include "helper/heartbeat/CellularHeartbeat.h"
 #include "helper/labels/ChannelRemap.h"
@@ -19,6 +20,7 @@ class HelperRoutines final : public UnbuiltRoutines {
   // The areas; each outlives the routines.
   struct Areas {
     PreferenceTransfer& preferences;
+    CarrierOperations& carrier;
     RadioLogging& radioLogging;
     LabelRoutines& labels;
     ChannelRemap& channelRemap;
@@ -43,6 +45,28 @@ class HelperRoutines final : public UnbuiltRoutines {
   KernelReturn server_BVMobileHelperLoadPlistFile(PortName port, char* path,
                                                   OutOfLinePayload* contents) override {
     return areas_.preferences.loadPlistFile(port, path, contents);
+  }
+  KernelReturn server_BVMobileHelperReplaceCarrierSymlink(PortName port, char* target, char* linkPath,
+                                                          char* domain) override {
+    return areas_.carrier.replaceCarrierSymlink(port, target, linkPath, domain);
+  }
+  KernelReturn server_BVMobileHelperCreateSymlink(PortName port, char* target, char* linkPath) override {
+    return areas_.carrier.createSymlink(port, target, linkPath);
+  }
+  KernelReturn server_BVMobileHelperRemoveCarrierFile(PortName port, char* path, char* domain) override {
+    return areas_.carrier.removeCarrierFile(port, path, domain);
+  }
+  KernelReturn server_BVMobileHelperCopyCarrierFile(PortName port, char* sourceDirectory, char* destinationDirectory,
+                                                    char* fileName, std::uint8_t* success) override {
+    return areas_.carrier.copyCarrierFile(port, sourceDirectory, destinationDirectory, fileName, success);
+  }
+  KernelReturn server_BVMobileHelperCopyCrashLogs(PortName port, char* path, std::uint8_t* success) override {
+    return areas_.carrier.copyCrashLogs(port, path, success);
+  }
+  KernelReturn server_BVMobileHelperMoveIntoCarrierBundles(PortName port, char* sourcePath,
+                                                           char* destinationDirectory, char* name,
+                                                           std::uint8_t* success) override {
+    return areas_.carrier.moveIntoCarrierBundles(port, sourcePath, destinationDirectory, name, success);
   }
   KernelReturn server_BVMobileHelperEnableRadioManagerLogs(PortName port, std::int32_t enable) override {
     return areas_.radioLogging.BVMobileHelperEnableRadioManagerLogs(port, enable);

@@ -11,6 +11,9 @@
 #include <exception>
 #include <string>
 
+#include "helper/carrier/CarrierOperations.h"
+#include "helper/carrier/FileSystemManager.h"
+#include "helper/carrier/PathPolicy.h"
 #include "helper/core/EntryPoint.h"
 #include "helper/core/HelperRoutines.h"
 #include "helper/entitlement/EntitlementCheck.h"
@@ -19,6 +22,7 @@
 #include "platform/accounts/linux/PasswordDatabase.h"
 #include "platform/baseband/linux/LoadedBasebandLibrary.h"
 #include "platform/contacts/linux/SqliteContacts.h"
+#include "platform/files/linux/LinuxFileManager.h"
 #include "platform/ipc/linux/SystemBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/labeler/linux/CatalogueLabeler.h"
@@ -75,7 +79,16 @@ int run() {
   LoadedBasebandLibrary baseband;
 
   FilePreferences preferences;
-  PreferenceTransfer preferenceTransfer(preferences, regions, [](const char*) { return PropertyList(); });
+  LinuxFileManager files;
+  PreferenceTransfer preferenceTransfer(preferences, regions, [&files](const char* path) {
+    return FileSystemManager(files).readDictionary(path);
+  });
+  const auto mobileAccount = [&mobile] {
+    return MobileAccount{mobile.homeDirectory(), mobile.uid(), mobile.gid()};
+  };
+  PathPolicy policy(mobileAccount);
+  CarrierOperations carrier(FileSystemManager::factory(files), [] { return nullptr; }, policy, preferences,
+                            mobileAccount);
   ModemManagerLogs radio(queues);
   RadioLogging radioLogging(radio);
 
@@ -97,6 +110,7 @@ int run() {
   heartbeat.configure({.queues = queues, .network = echoNetwork});
 
   HelperRoutines routines({.preferences = preferenceTransfer,
+                           .carrier = carrier,
                            .radioLogging = radioLogging,
                            .labels = labels,
                            .channelRemap = channelRemap,
