@@ -1,0 +1,162 @@
+# SPDX-License-Identifier: Apache-2.0
+# SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+"""bvhelperctl, and through it the C library, against the real daemon."""
+import datetime
+import json
+import pathlib
+import plistlib
+import shutil
+import subprocess
+import tempfile
+
+import wire
+from harness import ALLOW, BUILD, ENTITLEMENTS, LOG_ERR, Daemon, HelperTest, entitle, main
+
+# Where every account may run it, which the build folder need not be.
+TOOL = pathlib.Path("/run/bin/bvhelperctl")
+OWN_FILE = ENTITLEMENTS / "bvhelperctl.plist"
+
+
+def run(*arguments, account=None):
+    return subprocess.run([TOOL, *arguments], capture_output=True, text=True, timeout=60, stdin=subprocess.DEVNULL,
+                          user=account, group=account, extra_groups=[] if account else None)
+
+
+class ToolTest(HelperTest):
+    @classmethod
+    def setUpClass(cls):
+        TOOL.parent.mkdir(mode=0o755, exist_ok=True)
+        shutil.copy(BUILD / TOOL.name, TOOL)
+
+    def prepare(self):
+        entitle(OWN_FILE.name, executable=TOOL)
+        self.addCleanup(lambda: OWN_FILE.unlink(missing_ok=True))
+        folder = tempfile.TemporaryDirectory()
+        self.addCleanup(folder.cleanup)
+        self.folder = pathlib.Path(folder.name)
+
+    def expect(self, says, *arguments, status=0):
+        done = run(*arguments)
+        self.assertEqual((done.returncode, done.stdout + done.stderr), (status, says), arguments)
+
+    def json(self, *arguments, status=0):
+        done = run("--json", *arguments)
+        self.assertEqual((done.returncode, done.stderr), (status, ""), arguments)
+        return json.loads(done.stdout)
+
+
+class Admission(ToolTest):
+    def test_an_entitled_tool_is_admitted(self):
+        self.expect("the helper answers\n", "ping")
+
+    def test_what_a_refused_tool_advises_admits_it(self):
+        OWN_FILE.unlink()
+        refused = run("ping")
+        self.assertEqual((refused.returncode, refused.stdout), (1, ""))
+        lines = refused.stderr.splitlines()
+        self.assertEqual(lines[0], f"bvhelperctl: refused: the caller lacks the entitlement {ALLOW}")
+        self.assertIn(str(OWN_FILE), lines[1])
+        OWN_FILE.write_text("\n".join(line.removeprefix("  ") for line in lines[2:]) + "\n")
+        OWN_FILE.chmod(0o644)
+        self.expect("the helper answers\n", "ping")
+
+    def test_the_advice_names_the_account_of_the_caller(self):
+        refused = run("ping", account="telephony")
+        self.assertEqual(refused.returncode, 1)
+        advice = "\n".join(line.removeprefix("  ") for line in refused.stderr.splitlines()[2:])
+        self.assertEqual(plistlib.loads(advice.encode())["User"], "telephony")
+        (ENTITLEMENTS / "60-telephony.plist").write_text(advice)
+        self.addCleanup((ENTITLEMENTS / "60-telephony.plist").unlink)
+        self.assertEqual(run("ping", account="telephony").returncode, 0)
+        self.assertEqual(run("ping", account="stranger").returncode, 1)
+
+
+class Preferences(ToolTest):
+    DOMAIN = "com.norvale.carrier"
+
+    def test_values_of_every_type_come_back(self):
+        for kind, given, wanted in [("string", "K\u00f6ln", "K\u00f6ln"), ("integer", "-12", -12), ("bool", "yes", True),
+                                    ("integer", str(2**63 - 1), 2**63 - 1), ("real", "0.5", 0.5),
+                                    ("data", "Zm9v", {"base64": "Zm9v"}), ("string", "", "")]:
+            self.expect(f"set Key of {self.DOMAIN}\n", "prefs", "set", self.DOMAIN, "Key", given, "--type", kind)
+            for words in ("get", "get-app"):
+                answer = self.json("prefs", words, self.DOMAIN, "Key")
+                self.assertEqual((answer["found"], answer["value"]), (True, wanted))
+        with wire.Client() as client:  # an independent reader sees the last one
+            self.assertEqual(plistlib.loads(client.copy_preference(self.DOMAIN, "Key")), "")
+
+    def test_a_deleted_value_is_gone(self):
+        self.expect(f"set Key of {self.DOMAIN}\n", "prefs", "set", self.DOMAIN, "Key", "v")
+        self.expect(f"removed Key of {self.DOMAIN}\n", "prefs", "delete", self.DOMAIN, "Key")
+        self.expect("(no value)\n", "prefs", "get", self.DOMAIN, "Key")
+        self.assertIs(self.json("prefs", "get", self.DOMAIN, "Key")["found"], False)
+
+    def test_a_value_larger_than_a_datagram_goes_and_comes_in_memory(self):
+        value = {"Text": "x" * 100_000, "List": list(range(20_000))}
+        file = self.folder / "value.plist"
+        for form in (plistlib.FMT_XML, plistlib.FMT_BINARY):
+            file.write_bytes(plistlib.dumps(value, fmt=form))
+            self.expect(f"set Large of {self.DOMAIN}\n", "prefs", "set", self.DOMAIN, "Large", str(file), "--type",
+                        "plist-file")
+            self.assertEqual(self.json("prefs", "get", self.DOMAIN, "Large")["value"], value)
+
+    def test_a_text_that_is_not_utf8_is_refused_by_the_helper(self):
+        self.expect("bvhelperctl: the helper could not do it (code 5)\n", "prefs", "get", b"\xff", "k", status=1)
+
+
+class Files(ToolTest):
+    def test_a_property_list_file_is_shown(self):
+        file = self.folder / "a.plist"
+        file.write_bytes(plistlib.dumps({"Name": "Norvale", "When": datetime.datetime(2024, 2, 29, 12, 30),
+                                         "List": [1, {"k": b"v"}]}, sort_keys=False))
+        self.expect("Name: Norvale\nWhen: 2024-02-29T12:30:00Z\nList:\n  - 1\n  -\n    k: <1 byte: 76>\n", "plist", "load",
+                    str(file))
+        self.assertEqual(self.json("plist", "load", str(file))["value"],
+                         {"Name": "Norvale", "When": "2024-02-29T12:30:00Z", "List": [1, {"k": {"base64": "dg=="}}]})
+
+    def test_a_file_that_is_none_is_explained(self):
+        missing = f"{self.folder}/none"
+        self.expect(f"bvhelperctl: {missing} is missing, not readable for the helper, or no property list with a "
+                    "dictionary on top (code 9)\n", "plist", "load", missing, status=1)
+
+
+class Switches(ToolTest):
+    def test_radio_logs(self):
+        self.expect("radio manager logs on\n", "radio-logs", "on")
+        self.logs.wait_for("bsd", LOG_ERR, "Enabling wireless radio manager logs: 1")
+
+
+class Life(ToolTest):
+    def test_no_daemon_is_told_with_status_2(self):
+        self.daemon.stop()
+        done = run("ping")
+        self.assertEqual(done.returncode, 2)
+        self.assertIn("cannot reach the helper at /run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper", done.stderr)
+
+    def test_many_short_lives_leave_nothing_in_the_daemon(self):
+        run("ping")
+        before = self.daemon.descriptors()
+        for _ in range(30):
+            self.assertEqual(run("prefs", "get", "d", "k").returncode, 0)
+        with wire.Client():  # the daemon has dealt with everything that came before
+            pass
+        self.assertLessEqual(self.daemon.descriptors(), before + 2)
+
+
+class Activated(ToolTest):
+    activated = True
+
+    def test_a_daemon_that_leaves_before_it_answers_is_asked_again(self):
+        # The connection waits in the listening socket while there is no daemon; the next one takes it.
+        listening = self.daemon.listening
+        self.daemon.process.kill()
+        self.daemon.process.wait()
+        tool = subprocess.Popen([TOOL, "ping"], stdout=subprocess.PIPE, text=True)
+        second = Daemon(activated=True, listening=listening)
+        self.addCleanup(second.stop)
+        out, _ = tool.communicate(timeout=60)
+        self.assertEqual((tool.returncode, out), (0, "the helper answers\n"))
+
+
+if __name__ == "__main__":
+    main()
