@@ -1,0 +1,106 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+namespace brenvik {
+
+// What the archive reader, a process of its own, tells the helper through a pipe: frames, each a header and
+// `length` bytes. Both run on one machine and are of one build, so numbers stand as in memory; but the reader
+// handles hostile bytes, and nothing that it says is believed without a check.
+namespace archive_frame {
+
+enum class Type : std::uint32_t {
+  entry = 1,      // EntryHead, path, link target: the next entry begins
+  data = 2,       // bytes of the file
+  companion = 3,  // bytes of the file's companion: resource data and extended attributes
+  endOfEntry = 4,
+  end = 5,      // the archive was read to its end
+  refused = 6,  // Refusal, path: an entry that the reader does not hand over
+  failed = 7    // Refusal: the archive cannot be read on
+};
+
+struct Head {
+  Type type;
+  std::uint32_t length;
+};
+static_assert(sizeof(Head) == 8);
+
+enum class Kind : std::uint8_t { file = 0, directory = 1, link = 2 };
+
+struct EntryHead {
+  std::uint64_t size;     // of a file's data, as the archive claims; kUnknownSize
+  std::int64_t modified;  // seconds since 1970; kNoTime
+  std::uint16_t pathLength;
+  std::uint16_t targetLength;
+  Kind kind;
+  std::uint8_t isExecutable;
+  std::uint8_t pad[2];
+};
+static_assert(sizeof(EntryHead) == 24);
+
+struct Refusal {
+  std::int32_t code;  // errno value
+};
+
+inline constexpr std::uint64_t kUnknownSize = ~std::uint64_t{0};
+inline constexpr std::int64_t kNoTime = INT64_MIN;
+inline constexpr std::size_t kLongestPath = 1024;
+inline constexpr std::uint32_t kLargestChunk = 1 << 20;      // of data or companion in one frame
+inline constexpr std::uint32_t kLargestCompanion = 4 << 20;  // as much as the reader hands over
+
+}  // namespace archive_frame
+
+struct ArchiveEntry {
+  archive_frame::Kind kind = archive_frame::Kind::file;
+  bool isExecutable = false;
+  std::uint64_t size = archive_frame::kUnknownSize;
+  std::int64_t modified = archive_frame::kNoTime;
+  std::string path;    // as the archive has it, not checked
+  std::string target;  // of a link, not checked
+};
+
+// Is told what the frames say, in order. Each call returns 0 to go on or an errno value to stop.
+class ArchiveFrameSink {
+ public:
+  virtual ~ArchiveFrameSink() = default;
+  virtual int beginEntry(const ArchiveEntry& entry) = 0;
+  virtual int entryData(std::string_view bytes) = 0;       // between beginEntry and endEntry, of files only
+  virtual int entryCompanion(std::string_view bytes) = 0;  // between beginEntry and endEntry
+  virtual int endEntry() = 0;
+  virtual int refuseEntry(const std::string& path, int code) = 0;
+};
+
+// Takes the reader's bytes apart as they come. A frame that no correct reader sends ends it with EPROTO; it
+// never holds more than one entry's head. One thread; may throw std::bad_alloc.
+class ArchiveFrameParser {
+ public:
+  explicit ArchiveFrameParser(ArchiveFrameSink& sink) : sink_(sink) {}
+
+  // 0: wants more bytes, or has finished. Else the errno value that ended it: EPROTO, what the sink returned,
+  // or what the reader reported as its failure. Not to be called again after that.
+  int take(std::string_view bytes);
+  // The reader has read the archive to its end; no byte may follow.
+  bool hasFinished() const { return finished_; }
+
+ private:
+  int takeHead();
+  int takeSmallFrame();
+  int takeEntry();
+
+  ArchiveFrameSink& sink_;
+  archive_frame::Head head_{};
+  std::string pending_;     // a frame's head, or a small frame's bytes, as far as they came
+  bool inFrame_ = false;    // head_ stands, its bytes are still to come
+  std::uint32_t left_ = 0;  // bytes of a chunk still to come
+  bool inEntry_ = false;
+  archive_frame::Kind kind_ = archive_frame::Kind::file;
+  std::uint32_t companionBytes_ = 0;  // of the entry
+  bool finished_ = false;
+};
+
+}  // namespace brenvik

@@ -1,0 +1,92 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/files/linux/ReaderProcess.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <spawn.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <csignal>
+#include <memory>
+
+namespace brenvik {
+namespace {
+
+constexpr std::size_t kBuffer = 256 << 10;
+constexpr int kPipe = 256 << 10;  // room for the reader to work ahead
+
+}  // namespace
+
+ReaderProcess::~ReaderProcess() {
+  if (pid_ <= 0) return;
+  ::kill(pid_, SIGKILL);
+  while (::waitpid(pid_, nullptr, 0) < 0 && errno == EINTR) {
+  }
+}
+
+int ReaderProcess::start(const std::string& program, int input) {
+  int ends[2];
+  if (::pipe2(ends, O_CLOEXEC) != 0) return errno;
+  output_.reset(ends[0]);
+  const UniqueFd theirs(ends[1]);
+  (void)::fcntl(theirs.get(), F_SETPIPE_SZ, kPipe);  // smaller is only slower
+
+  posix_spawn_file_actions_t actions;
+  posix_spawnattr_t attributes;
+  if (const int error = ::posix_spawn_file_actions_init(&actions); error != 0) return error;
+  if (const int error = ::posix_spawnattr_init(&attributes); error != 0) {
+    ::posix_spawn_file_actions_destroy(&actions);
+    return error;
+  }
+  sigset_t all;
+  sigset_t none;
+  ::sigfillset(&all);
+  ::sigemptyset(&none);
+  char argument[] = "brenvik-archive-reader";
+  char locale[] = "LC_ALL=C.UTF-8";
+  char* const arguments[] = {argument, nullptr};
+  char* const environment[] = {locale, nullptr};
+  int error = ::posix_spawn_file_actions_adddup2(&actions, input, STDIN_FILENO);
+  if (error == 0) error = ::posix_spawn_file_actions_adddup2(&actions, theirs.get(), STDOUT_FILENO);
+  if (error == 0)
+    error = ::posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
+  if (error == 0) error = ::posix_spawn_file_actions_addclosefrom_np(&actions, STDERR_FILENO + 1);
+  if (error == 0) error = ::posix_spawnattr_setsigdefault(&attributes, &all);
+  if (error == 0) error = ::posix_spawnattr_setsigmask(&attributes, &none);
+  if (error == 0) {
+    error = ::posix_spawnattr_setflags(&attributes,
+                                       static_cast<short>(POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETSIGMASK));
+  }
+  if (error == 0)
+    error = ::posix_spawn(&pid_, program.c_str(), &actions, &attributes, arguments, environment);
+  ::posix_spawnattr_destroy(&attributes);
+  ::posix_spawn_file_actions_destroy(&actions);
+  if (error != 0) pid_ = -1;
+  return error;
+}
+
+int ReaderProcess::drain(std::chrono::steady_clock::time_point deadline,
+                         const std::function<int(std::string_view)>& take,
+                         const std::function<bool()>& isComplete) {
+  const auto buffer = std::make_unique_for_overwrite<char[]>(kBuffer);
+  for (;;) {
+    const auto left =
+        std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+    if (left.count() <= 0) return ETIMEDOUT;
+    pollfd ready{output_.get(), POLLIN, 0};
+    const int polled = ::poll(&ready, 1, static_cast<int>(std::min<std::int64_t>(left.count(), 60'000)));
+    if (polled < 0 && errno != EINTR) return errno;
+    if (polled <= 0) continue;
+    const ssize_t got = ::read(output_.get(), buffer.get(), kBuffer);
+    if (got < 0 && errno == EINTR) continue;
+    if (got < 0) return errno;
+    if (got == 0) return isComplete() ? 0 : EPIPE;
+    if (const int error = take({buffer.get(), static_cast<std::size_t>(got)}); error != 0) return error;
+  }
+}
+
+}  // namespace brenvik

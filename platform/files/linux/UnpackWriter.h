@@ -1,0 +1,72 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <string>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/files/ArchiveCopier.h"
+#include "platform/files/archive/ArchiveFrames.h"
+
+namespace brenvik {
+
+struct UnpackOptions {
+  bool extendedAttributes = false;
+  bool resources = false;
+};
+
+// Writes an archive's entries beneath a directory that nobody else writes to, and nowhere else: every path is
+// checked, and the kernel is told to follow no link and leave no subtree. Files get mode 0644 or 0755 and
+// their time; directories 0755. One thread; may throw std::bad_alloc.
+class UnpackWriter final : public ArchiveFrameSink {
+ public:
+  static constexpr std::uint64_t kMostEntries = 100'000;
+  static constexpr std::uint64_t kMostBytes = std::uint64_t{1} << 30;
+
+  // `top` outlives the object. `mostBytes`: of all files together. `onFileError` answers as ArchiveCopier
+  // says.
+  UnpackWriter(int top, UnpackOptions options, std::uint64_t mostBytes,
+               std::function<int(const ArchiveFileError&)> onFileError);
+
+  int beginEntry(const ArchiveEntry& entry) override;
+  int entryData(std::string_view bytes) override;
+  int entryCompanion(std::string_view bytes) override;
+  int endEntry() override;
+  int refuseEntry(const std::string& path, int code) override;
+
+  // Whether what ended the copy was an answer of onFileError; then there is nothing more to say about it.
+  bool wasStoppedByAnswer() const { return stoppedByAnswer_; }
+
+ private:
+  int fileError(const std::string& path, int code);
+  int start(const ArchiveEntry& entry);
+  int openParent(const std::string& directory);
+  int makeFile(const char* name, mode_t mode, UniqueFd* file);
+  int finishEntry();
+  int count(std::uint64_t bytes);
+
+  const int top_;
+  const UnpackOptions options_;
+  const std::uint64_t mostBytes_;
+  const std::function<int(const ArchiveFileError&)> onFileError_;
+  mode_t umask_ = 0777;
+
+  std::uint64_t entries_ = 0;
+  std::uint64_t bytes_ = 0;
+  bool stoppedByAnswer_ = false;
+
+  std::string parentPath_;  // of parent_
+  UniqueFd parent_;
+
+  ArchiveEntry entry_;
+  std::string name_;  // of the entry in its directory
+  bool skipping_ = false;
+  std::uint64_t written_ = 0;
+  UniqueFd file_;
+  UniqueFd companion_;
+  std::string companionHead_;  // as much as attributes are looked for in
+};
+
+}  // namespace brenvik
