@@ -14,6 +14,7 @@ namespace brenvik {
 // What a push came to: the error's domain in the lower 32 bits, its code in the upper; code 0 is success.
 using TelephonyResult = std::uint64_t;
 inline constexpr std::uint32_t kPosixErrorDomain = 1;
+inline constexpr std::uint32_t kKernelErrorDomain = 2;  // return codes of the message layer
 
 constexpr TelephonyResult telephonyResult(std::uint32_t domain, std::int32_t code) noexcept {
   return (std::uint64_t{static_cast<std::uint32_t>(code)} << 32) | domain;
