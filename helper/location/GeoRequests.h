@@ -26,8 +26,8 @@ class GeoRequests : public std::enable_shared_from_this<GeoRequests> {
               GeoRequestState& state)
       : queues_(queues), geoService_(geoService), telephonyDaemon_(telephonyDaemon), state_(state) {}
 
-  // Runs the task on the GEO callback queue, unless closed by then. Any thread.
-  void postToGeoCallbackQueue(WorkQueue::Task task);
+  // Has the work item of a request run on the GEO callback queue, unless closed by then. Main loop.
+  void dispatch(WorkQueue::Task workItem);
 
   // Waits for the task that runs on the GEO callback queue; none starts afterwards. Main loop.
   void close() noexcept;
@@ -48,6 +48,8 @@ class GeoRequests : public std::enable_shared_from_this<GeoRequests> {
     std::string postalCode;
   };
 
+  // Runs the task on the GEO callback queue, unless closed by then. Any thread.
+  void postToGeoCallbackQueue(WorkQueue::Task task);
   std::shared_ptr<WorkQueue> geoCallbackQueue() { return state_.geoCallbackQueue(queues_); }
   // Reads the flag once and, when it was set, clears it once; returns what was read.
   bool takeAwaitedResponse() noexcept;

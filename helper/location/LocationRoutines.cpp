@@ -49,13 +49,13 @@ KernelReturn LocationRoutines::server_BVMobileHelperRequestWanIPFromLocation(Por
 
 void LocationRoutines::dispatchCivicInfoRequest(double latitude, double longitude) noexcept {
   const CivicInfoRequestContext context{latitude, longitude};
-  requests_->postToGeoCallbackQueue([requests = requests_, context] {
+  requests_->dispatch([requests = requests_, context] {
     requests->requestCivicInfoFromLatitudeLongitude(context.latitude, context.longitude);
   });
 }
 
 void LocationRoutines::dispatchWanIpRequest() noexcept {
-  requests_->postToGeoCallbackQueue([requests = requests_] { requests->requestWanIpFromLocation(); });
+  requests_->dispatch([requests = requests_] { requests->requestWanIpFromLocation(); });
 }
 
 }  // namespace brenvik

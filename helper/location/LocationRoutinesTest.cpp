@@ -120,6 +120,14 @@ TEST_F(LocationRoutinesTest, RoutinesAnswerBeforeTheGeoServiceIsAsked) {
   EXPECT_EQ(log.entries(), (Lines{kCivicAsked, kWanIpAsked}));
 }
 
+TEST_F(LocationRoutinesTest, TheOtherThreadIsNotWokenBeforeTheReplyHasGoneOut) {
+  askCivicInfo();
+  askWanIp();
+  EXPECT_EQ(geoQueue().pending(), 0U) << "the main loop sends the replies first";
+  queues.main().runReady();
+  EXPECT_EQ(geoQueue().pending(), 2U);
+}
+
 TEST_F(LocationRoutinesTest, CivicTicketHasTheArgumentsOfTheHelperItself) {
   askCivicInfo(-33.8568, 151.2153);
   settle();
@@ -326,6 +334,7 @@ TEST_F(LocationRoutinesTest, AWholeAddressIsLoggedAndPushed) {
 
 TEST_F(LocationRoutinesTest, LatitudeAndLongitudeZeroAreNotLookedUp) {
   EXPECT_EQ(askCivicInfo(0.0, 0.0), kern::success);
+  queues.main().runReady();
   geoQueue().runReady();
   EXPECT_FALSE(state.isAwaitingGeoResponse());
   EXPECT_EQ(clock.scheduled(), 0U) << "no time-out is armed";
