@@ -1,0 +1,309 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+//
+// Two things. What a caller waits for who asks for its public address or for a place, beside an empty request
+// that writes the same line into the same log, over the same channel to the same process: real transport,
+// real routines, real queues; only the geo service never answers. What the line itself costs depends on who
+// listens to the log; a request without it is shown too. And the offline gazetteer's look-ups, warm, at
+// positions around random places, beside reading one row by its number from the same file.
+//
+// usage: LocationBenchmark GAZETTEER.db [PAIRS [LOOK-UPS]]
+#include <benchmark/benchmark.h>
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <functional>
+#include <limits>
+#include <memory>
+#include <random>
+#include <string>
+#include <vector>
+
+#include "helper/location/GeoRequestState.h"
+#include "helper/location/LocationRoutines.h"
+#include "interface/Messages.h"
+#include "platform/base/UniqueFd.h"
+#include "platform/geo/linux/Gazetteer.h"
+#include "platform/ipc/linux/SystemPortSources.h"
+#include "platform/log/linux/SystemLog.h"
+#include "platform/runloop/linux/SystemQueues.h"
+
+namespace brenvik {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+using Times = std::vector<double>;  // microseconds
+
+constexpr std::int32_t kEmpty = 1;
+constexpr std::int32_t kWanIp = 2;
+constexpr std::int32_t kCivicInfo = 3;
+constexpr std::int32_t kOneUnifiedLine = 4;
+constexpr std::int32_t kOneBsdLine = 5;
+constexpr double kMostOfAnEmptyRequest = 1.1;
+constexpr double kMostOfALookUp = 1000;  // microseconds, for 99 of 100
+
+class GeoServiceNeverAnswers final : public GeoService {
+ public:
+  std::unique_ptr<ReverseGeocodeTicket> makeReverseGeocodeTicket(Coordinate, IncludeEta, ShiftLocations,
+                                                                 const GeoTraits*) override {
+    struct Ticket final : ReverseGeocodeTicket {
+      void submit(ReverseGeocodeHandler, const GeoNetworkActivity*,
+                  const std::shared_ptr<WorkQueue>&) override {}
+    };
+    return std::make_unique<Ticket>();
+  }
+  std::unique_ptr<GeoIpTicket> makeGeoIpTicket(const std::optional<std::string>&) override {
+    struct Ticket final : GeoIpTicket {
+      void submit(GeoIpHandler, const AuditToken*, const GeoNetworkActivity*,
+                  const std::shared_ptr<WorkQueue>&) override {}
+    };
+    return std::make_unique<Ticket>();
+  }
+  std::optional<std::string> currentCountryCode() override { return std::nullopt; }
+};
+
+class NoTelephonyDaemon final : public TelephonyDaemon {
+ public:
+  void addIdentifierException(std::string_view) override {}
+  std::unique_ptr<TelephonyDaemonConnection> create(std::function<void()>) noexcept override {
+    return nullptr;
+  }
+};
+
+class BenchmarkTable final : public RoutineTable {
+ public:
+  explicit BenchmarkTable(LocationRoutines& routines) noexcept : routines_(routines) {}
+  Handler find(std::int32_t id) const noexcept override {
+    switch (id) {
+      case kWanIp:
+        return [](void* context, const Request&, Reply& reply) {
+          reply.setStatus(
+              static_cast<LocationRoutines*>(context)->server_BVMobileHelperRequestWanIPFromLocation(1));
+          return Outcome::accepted;
+        };
+      case kCivicInfo:
+        return [](void* context, const Request& request, Reply& reply) {
+          const auto& message = request.as<CoordinateRequest>();
+          reply.setStatus(
+              static_cast<LocationRoutines*>(context)->server_BVMobileHelperRequestCountryCodeFromLocation(
+                  1, message.latitude, message.longitude));
+          return Outcome::accepted;
+        };
+      case kOneUnifiedLine:
+        return [](void*, const Request&, Reply& reply) {
+          logUnified(LogLevel::debug, "server_BVMobileHelperRequestWanIPFromLocation");
+          reply.setStatus(kern::success);
+          return Outcome::accepted;
+        };
+      case kOneBsdLine:
+        return [](void*, const Request&, Reply& reply) {
+          logBsd(SyslogPriority::error, "server_BVMobileHelperRequestCountryCodeFromLocation \n");
+          reply.setStatus(kern::success);
+          return Outcome::accepted;
+        };
+      default:
+        return [](void*, const Request&, Reply& reply) {
+          reply.setStatus(kern::success);
+          return Outcome::accepted;
+        };
+    }
+  }
+  void* context() const noexcept override { return &routines_; }
+
+ private:
+  LocationRoutines& routines_;
+};
+
+// A process that serves the table until this one goes.
+class Server {
+ public:
+  Server() {
+    PortName port = kNullPort;
+    if (ports_.allocateReceiveRight(&port) != kern::success ||
+        ports_.insertSendRight(port) != kern::success) {
+      std::abort();
+    }
+    client_ = UniqueFd(::fcntl(ports_.sendEnd(port)->get(), F_DUPFD_CLOEXEC, 0));
+    child_ = ::fork();
+    if (child_ == 0) serve(port);
+    (void)ports_.dropReceiveRight(port);
+  }
+  Server(const Server&) = delete;
+  Server& operator=(const Server&) = delete;
+  ~Server() {
+    ::kill(child_, SIGKILL);
+    ::waitpid(child_, nullptr, 0);
+  }
+  // Sends the request and waits for its status; microseconds.
+  template <typename Message>
+  double exchange(const Message& request) {
+    const auto before = Clock::now();
+    StatusReply reply{};
+    if (::send(client_.get(), &request, sizeof request, MSG_NOSIGNAL) < 0 ||
+        ::recv(client_.get(), &reply, sizeof reply, 0) != sizeof reply || reply.returnCode != kern::success) {
+      std::fprintf(stderr, "the server refuses\n");
+      std::exit(2);
+    }
+    return std::chrono::duration<double, std::micro>(Clock::now() - before).count();
+  }
+
+ private:
+  [[noreturn]] void serve(PortName port) {
+    ::prctl(PR_SET_PDEATHSIG, SIGKILL);
+    client_.reset();
+    ::dup2(::open("/dev/null", O_WRONLY | O_CLOEXEC), STDERR_FILENO);
+    SystemLog log("LocationBenchmark");
+    setLogSink(&log);
+    const auto loop = SystemRunLoop::make();
+    SystemQueues queues(*loop);
+    SystemRegions regions;
+    SystemPortSources sources(ports_, regions);
+    GeoServiceNeverAnswers geo;
+    NoTelephonyDaemon telephony;
+    LocationRoutines routines(queues, geo, telephony, GeoRequestState::shared());
+    BenchmarkTable table(routines);
+    const auto source = sources.makeRoutineSource(port, table, WantTrailer::no);
+    if (source == nullptr || !source->addTo(*loop)) ::_exit(1);
+    (void)loop->run(std::chrono::duration<double>(std::numeric_limits<double>::max()), ReturnAfterSource::no);
+    ::_exit(0);
+  }
+
+  SystemPortSpace ports_;
+  UniqueFd client_;
+  pid_t child_ = -1;
+};
+
+double quantile(Times& times, double share) {
+  const auto at =
+      std::min(times.size() - 1, static_cast<std::size_t>(static_cast<double>(times.size()) * share));
+  std::nth_element(times.begin(), times.begin() + static_cast<std::ptrdiff_t>(at), times.end());
+  return times[at];
+}
+
+MessageHeader headerOf(std::int32_t id, std::size_t size) {
+  return {kReplyDisposition, static_cast<std::uint32_t>(size), 1, 0, 0, id};
+}
+
+bool compareRequests(int pairs) {
+  Server server;
+  const CoordinateRequest civicInfo{headerOf(kCivicInfo, sizeof(CoordinateRequest)), kNdrRecord, 48.8584,
+                                    2.2945};
+  struct Measured {
+    const char* name;
+    std::function<double()> exchange;
+    Times times;
+  };
+  const auto plain = [&](std::int32_t id) {
+    return [&server, request = EmptyRequest{headerOf(id, sizeof(EmptyRequest))}] {
+      return server.exchange(request);
+    };
+  };
+  std::array measured{Measured{"empty request", plain(kEmpty), {}},
+                      Measured{"empty, one unified line", plain(kOneUnifiedLine), {}},
+                      Measured{"public address asked for", plain(kWanIp), {}},
+                      Measured{"empty, one BSD line", plain(kOneBsdLine), {}},
+                      Measured{"civic address asked for", [&] { return server.exchange(civicInfo); }, {}}};
+  // In turns, and each after the same pause, so that what a request set going has come to rest.
+  for (int i = 0; i < pairs; ++i) {
+    for (Measured& each : measured) {
+      ::usleep(300);
+      each.times.push_back(each.exchange());
+    }
+  }
+  std::array<double, measured.size()> medians;
+  for (std::size_t i = 0; i < measured.size(); ++i) {
+    medians[i] = quantile(measured[i].times, 0.5);
+    std::printf("%-32s %8.1f us\n", measured[i].name, medians[i]);
+  }
+  bool good = true;
+  for (const std::size_t i : {2U, 4U}) {
+    const double ratio = medians[i] / medians[i - 1];
+    const bool within = ratio <= kMostOfAnEmptyRequest;
+    std::printf("%-32s ratio %.3f, at most %.2f  %s\n", measured[i].name, ratio, kMostOfAnEmptyRequest,
+                within ? "ok" : "ABOVE");
+    good = good && within;
+  }
+  return good;
+}
+
+bool measureLookUps(const char* path, int count) {
+  auto database = SqliteDatabase::open(path, SQLITE_OPEN_READONLY);
+  if (!database) {
+    std::fprintf(stderr, "%s cannot be opened\n", path);
+    std::exit(2);
+  }
+  std::vector<Coordinate> places;
+  auto all = database->prepare("select min_lat, min_lng from place_at");
+  while (all.step() == SQLITE_ROW) {
+    places.push_back({static_cast<double>(all.integer(0)) / 1e5, static_cast<double>(all.integer(1)) / 1e5});
+  }
+  std::mt19937 random(1);
+  std::normal_distribution<double> aside(0, 0.05);  // degrees; a walk around the town
+  std::vector<Coordinate> positions;
+  for (int i = 0; i < count; ++i) {
+    const Coordinate& place = places.at(random() % places.size());
+    positions.push_back({std::clamp(place.latitude + aside(random), -90.0, 90.0),
+                         std::clamp(place.longitude + aside(random), -180.0, 180.0)});
+  }
+
+  Gazetteer gazetteer(path);
+  Times times;
+  Times bare;
+  auto row = database->prepare("select name from place where id = ?1");
+  for (int round = 0; round < 2; ++round) {  // the first warms the caches up
+    times.clear();
+    bare.clear();
+    for (const Coordinate& position : positions) {
+      // The thread's own time: what else the machine does is not the gazetteer's.
+      const auto now = [] {
+        timespec time{};
+        ::clock_gettime(CLOCK_THREAD_CPUTIME_ID, &time);
+        return static_cast<double>(time.tv_sec) * 1e6 + static_cast<double>(time.tv_nsec) / 1e3;
+      };
+      double before = now();
+      auto answer = gazetteer.lookUp(position);
+      times.push_back(now() - before);
+      if (answer.error) {
+        std::fprintf(stderr, "%s\n", answer.error->description.c_str());
+        std::exit(2);
+      }
+      before = now();
+      row.bind(1, static_cast<std::int64_t>(random() % places.size() + 1));
+      benchmark::DoNotOptimize(row.step());
+      benchmark::DoNotOptimize(row.text(0));
+      row.reset();
+      bare.push_back(now() - before);
+    }
+  }
+  const double median = quantile(times, 0.5);
+  const double slow = quantile(times, 0.99);
+  const bool within = slow < kMostOfALookUp;
+  std::printf("%-32s %8.1f us   %.1f times one row read by number (%.1f us)\n", "look-up, median", median,
+              median / quantile(bare, 0.5), quantile(bare, 0.5));
+  std::printf("%-32s %8.1f us   ratio %.3f to 1 ms, below 1  %s\n", "look-up, 99 of 100", slow,
+              slow / kMostOfALookUp, within ? "ok" : "ABOVE");
+  return within;
+}
+
+}  // namespace
+}  // namespace brenvik
+
+int main(int argc, char** argv) {
+  if (argc < 2) {
+    std::fprintf(stderr, "usage: LocationBenchmark GAZETTEER.db [PAIRS [LOOK-UPS]]\n");
+    return 2;
+  }
+  const bool requests = brenvik::compareRequests(argc > 2 ? std::atoi(argv[2]) : 3000);
+  const bool lookUps = brenvik::measureLookUps(argv[1], argc > 3 ? std::atoi(argv[3]) : 20000);
+  return requests && lookUps ? 0 : 1;
+}

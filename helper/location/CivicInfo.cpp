@@ -1,0 +1,110 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "helper/location/BrenvikPush.h"
+#include "helper/location/GeoRequests.h"
+#include "platform/log/Log.h"
+
+namespace brenvik {
+
+void GeoRequests::requestCivicInfoFromLatitudeLongitude(double latitude, double longitude) {
+  auto info = std::make_shared<CivicInfo>();
+  if (latitude == 0.0 && longitude == 0.0) {
+    // What a caller without a position sends. Nothing is submitted, so nothing is awaited.
+    postToMainQueue(&GeoRequests::pushCivicFallback);
+    return;
+  }
+  const auto ticket = geoService_.makeReverseGeocodeTicket({latitude, longitude}, IncludeEta::no,
+                                                           ShiftLocations::ifNeeded, nullptr);
+  awaitGeoResponse(&GeoRequests::pushCivicFallback);
+  ticket->submit(
+      [self = shared_from_this(), info = std::move(info)](const std::optional<MapItems>& items,
+                                                          const std::optional<GeoError>& error) {
+        const std::lock_guard lock(self->running_);
+        if (!self->closed_.load()) self->handleMapItems(*info, items, error);
+      },
+      nullptr, geoCallbackQueue());
+}
+
+void GeoRequests::handleMapItems(CivicInfo& info, const std::optional<MapItems>& items,
+                                 const std::optional<GeoError>& error) {
+  if (!takeAwaitedResponse()) {
+    logBsd(SyslogPriority::error,
+           "_RequestCivicInfoFromLatitudeLongitude wasn't waiting for response from GEO");
+    return;
+  }
+  takeFirstMapItem(info, items, error);
+  if (info.countryCode.empty()) info.countryCode = currentCountryCode();
+  sendCivicInfoToBrenvik(info);
+}
+
+// Fills `info` as far as the answer goes.
+void GeoRequests::takeFirstMapItem(CivicInfo& info, const std::optional<MapItems>& items,
+                                   const std::optional<GeoError>& error) {
+  // An error is told twice over: by its description, and by the line of an answer without items.
+  if (error) {
+    logBsd(SyslogPriority::error, "_RequestCivicInfoFromLatitudeLongitude error: (%s)",
+           error->description.c_str());
+  }
+  if (error || !items || items->empty()) {
+    logBsd(SyslogPriority::error, "_RequestCivicInfoFromLatitudeLongitude didn't get any mapItems\n");
+    return;
+  }
+  logBsd(SyslogPriority::notice, "_RequestCivicInfoFromLatitudeLongitude mapItems: (%lu)",
+         static_cast<unsigned long>(items->size()));
+  const std::optional<MapItem>& item = items->front();
+  if (!item || !item->valid) {
+    logBsd(SyslogPriority::error, "_RequestCivicInfoLatitudeLongitude NULL mapItem \n");
+    return;
+  }
+  if (!item->address || !item->address->structuredAddress) {
+    logBsd(SyslogPriority::error,
+           "_RequestCivicInfoLatitudeLongitude mapItem didn't get a structured address");
+    return;
+  }
+  const StructuredAddress& address = *item->address->structuredAddress;
+  if (address.countryCode) {
+    logBsd(SyslogPriority::notice, "_RequestCivicInfoFromLatitudeLongitude country code: %s",
+           address.countryCode->c_str());
+    info.countryCode = *address.countryCode;
+  }
+  if (address.administrativeArea) {
+    logBsd(SyslogPriority::notice, "_RequestCivicInfoFromLatitudeLongitude state: %s",
+           address.administrativeArea->c_str());
+    info.state = *address.administrativeArea;
+  }
+  if (address.locality) {
+    logBsd(SyslogPriority::notice, "_RequestCivicInfoFromLatitudeLongitude city: %s",
+           address.locality->c_str());
+    info.city = *address.locality;
+  }
+  if (address.postCode) {
+    logBsd(SyslogPriority::notice, "_RequestCivicInfoFromLatitudeLongitude postal code: %s",
+           address.postCode->c_str());
+    info.postalCode = *address.postCode;
+  }
+}
+
+void GeoRequests::pushCivicFallback() {
+  CivicInfo info;
+  info.countryCode = currentCountryCode();
+  pushOffMainQueue(
+      [self = shared_from_this(), info = std::move(info)] { self->sendCivicInfoToBrenvik(info); });
+}
+
+void GeoRequests::sendCivicInfoToBrenvik(const CivicInfo& info) {
+  const auto connection = openBrenvik(telephonyDaemon_);
+  if (connection == nullptr) {
+    logBsd(SyslogPriority::error, "sendCivicInfoToQV to Brenvik failed, could not open QVServerConnection");
+    return;
+  }
+  const TelephonyResult result = connection->setCivicInfoBasedOnCurrentLocation(
+      platformString(info.countryCode), platformString(info.state), platformString(info.city),
+      platformString(info.postalCode));
+  if (const std::int32_t code = errorCodeOf(result); code != 0) {
+    logBsd(SyslogPriority::notice, "sendCivicInfoToQV failed civic info to Brenvik due to error: %d", code);
+  } else {
+    logBsd(SyslogPriority::notice, "sendCivicInfoToQV sent civic info to Brenvik successfully");
+  }
+}
+
+}  // namespace brenvik

@@ -1,0 +1,37 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <mutex>
+
+#include "platform/runloop/WorkQueue.h"
+
+namespace brenvik {
+
+// What all geo requests of a process share: their queue, and whether an answer is awaited. Any thread.
+class GeoRequestState {
+ public:
+  // The state of this process. Its queue, if any, is released at process exit.
+  static GeoRequestState& shared();
+
+  // The serial queue "GEO callback queue", made exactly once, on the first call.
+  std::shared_ptr<WorkQueue> geoCallbackQueue(WorkQueues& queues);
+
+  // True from a request's submission until the first answer or time-out, whichever request it belongs to:
+  // requests have no identity, so of overlapping ones the first event does the work and the rest is dropped.
+  bool isAwaitingGeoResponse() const noexcept { return awaitingGeoResponse_.load(std::memory_order_relaxed); }
+  void setAwaitingGeoResponse(bool awaiting) noexcept {
+    awaitingGeoResponse_.store(awaiting, std::memory_order_relaxed);
+  }
+
+ private:
+  std::once_flag queueMade_;
+  std::shared_ptr<WorkQueue> queue_;
+  // Relaxed, and deliberately no exchange: an event reads it once and clears it once, and nothing is ordered
+  // by it.
+  std::atomic<bool> awaitingGeoResponse_{false};
+};
+
+}  // namespace brenvik

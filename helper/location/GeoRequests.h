@@ -1,0 +1,81 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "helper/location/GeoRequestState.h"
+#include "platform/geo/GeoService.h"
+#include "platform/runloop/WorkQueue.h"
+#include "platform/telephony/TelephonyDaemonConnection.h"
+
+namespace brenvik {
+
+// The work behind the location routines, shared by the queued tasks that carry it on. A request is submitted
+// to the geo service on the GEO callback queue; its answer comes back there, its time-out on the main queue,
+// and the first of them to find an answer awaited pushes to the telephony daemon.
+class GeoRequests : public std::enable_shared_from_this<GeoRequests> {
+ public:
+  // The references are used until close() returns and not afterwards.
+  GeoRequests(WorkQueues& queues, GeoService& geoService, TelephonyDaemon& telephonyDaemon,
+              GeoRequestState& state)
+      : queues_(queues), geoService_(geoService), telephonyDaemon_(telephonyDaemon), state_(state) {}
+
+  // Has the work item of a request run on the GEO callback queue, unless closed by then. Main loop.
+  void dispatch(WorkQueue::Task workItem);
+
+  // Waits for the task that runs on the GEO callback queue; none starts afterwards. Main loop.
+  void close() noexcept;
+
+  // GEO callback queue only.
+  void requestCivicInfoFromLatitudeLongitude(double latitude, double longitude);
+  void requestWanIpFromLocation();
+
+  // The country configuration's code; empty, and a line in the log, when none is known. Any thread.
+  std::string currentCountryCode();
+
+ private:
+  // What a reverse-geocode request has found so far; the request and its handler share it.
+  struct CivicInfo {
+    std::string countryCode;
+    std::string state;
+    std::string city;
+    std::string postalCode;
+  };
+
+  // Runs the task on the GEO callback queue, unless closed by then. Any thread.
+  void postToGeoCallbackQueue(WorkQueue::Task task);
+  std::shared_ptr<WorkQueue> geoCallbackQueue() { return state_.geoCallbackQueue(queues_); }
+  // Reads the flag once and, when it was set, clears it once; returns what was read.
+  bool takeAwaitedResponse() noexcept;
+  // Sets the flag and puts the fallback on the main queue, five seconds from now.
+  void awaitGeoResponse(void (GeoRequests::*fallback)());
+  void postToMainQueue(void (GeoRequests::*step)());
+  // Runs the push here, or on the GEO callback queue when this is the main queue.
+  void pushOffMainQueue(WorkQueue::Task push);
+
+  void handleMapItems(CivicInfo& info, const std::optional<MapItems>& items,
+                      const std::optional<GeoError>& error);
+  void takeFirstMapItem(CivicInfo& info, const std::optional<MapItems>& items,
+                        const std::optional<GeoError>& error);
+  void pushCivicFallback();
+  void sendCivicInfoToBrenvik(const CivicInfo& info);
+
+  void handleGeoIpResult(const std::optional<GeoIpResult>& result, const std::optional<GeoError>& error);
+  void pushWanIpFallback();
+  void sendWanIpToBrenvik(const std::string& address);
+
+  WorkQueues& queues_;
+  GeoService& geoService_;
+  TelephonyDaemon& telephonyDaemon_;
+  GeoRequestState& state_;
+  std::mutex running_;  // held by each task of the GEO callback queue, so that close() can wait for it
+  std::atomic<bool> closed_{false};
+};
+
+}  // namespace brenvik

@@ -1,0 +1,99 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/runloop/WorkQueue.h"
+
+namespace brenvik {
+
+struct AuditToken;
+class GeoTraits;           // a caller's wishes for an answer; nobody here has any
+class GeoNetworkActivity;  // a caller's activity that traffic is accounted to; nobody here has one
+
+// Degrees, north and east positive. Any numbers may stand here; the service judges them.
+struct Coordinate {
+  double latitude = 0;
+  double longitude = 0;
+};
+
+enum class IncludeEta { no, yes };
+enum class ShiftLocations { no, ifNeeded };
+
+// The parts of an address, UTF-8. A part the service does not know is absent.
+struct StructuredAddress {
+  std::optional<std::string> countryCode{};  // ISO 3166-1 alpha-2, upper case
+  std::optional<std::string> administrativeArea{};
+  std::optional<std::string> locality{};
+  std::optional<std::string> postCode{};
+};
+
+struct GeoAddress {
+  std::optional<StructuredAddress> structuredAddress;
+};
+
+// A place an answer speaks of.
+struct MapItem {
+  bool valid = true;
+  std::optional<GeoAddress> address;
+};
+using MapItems = std::vector<std::optional<MapItem>>;
+
+struct GeoError {
+  std::string description;  // for people, one line
+};
+
+struct GeoIpResult {
+  std::string ipAddress;  // as text; empty when there is none
+};
+
+// Exactly one of answer and error is given; an answer without items means that nothing is known of the place.
+using ReverseGeocodeHandler =
+    std::function<void(const std::optional<MapItems>&, const std::optional<GeoError>&)>;
+using GeoIpHandler = std::function<void(const std::optional<GeoIpResult>&, const std::optional<GeoError>&)>;
+
+// A question that has been put together and not yet asked. It may be destroyed as soon as it is submitted.
+class ReverseGeocodeTicket {
+ public:
+  virtual ~ReverseGeocodeTicket() = default;
+  // Asks. The handler runs once, later, as a task of `handlerQueue`: never from within this call, and not at
+  // all when the queue is gone by then. Any thread; does not wait.
+  virtual void submit(ReverseGeocodeHandler handler, const GeoNetworkActivity* networkActivity,
+                      const std::shared_ptr<WorkQueue>& handlerQueue) = 0;
+};
+
+class GeoIpTicket {
+ public:
+  virtual ~GeoIpTicket() = default;
+  // As above.
+  virtual void submit(GeoIpHandler handler, const AuditToken* auditToken,
+                      const GeoNetworkActivity* networkActivity,
+                      const std::shared_ptr<WorkQueue>& handlerQueue) = 0;
+};
+
+// The platform's geo service. Any thread. It must outlive its tickets; answers that are under way when it is
+// destroyed are dropped.
+class GeoService {
+ public:
+  virtual ~GeoService() = default;
+
+  // A ticket for the address at a coordinate. Never null.
+  virtual std::unique_ptr<ReverseGeocodeTicket> makeReverseGeocodeTicket(Coordinate coordinate,
+                                                                         IncludeEta includeEta,
+                                                                         ShiftLocations shiftLocations,
+                                                                         const GeoTraits* traits) = 0;
+
+  // A ticket for what is known of an address; absent: of the address under which this device is seen from
+  // outside. Never null.
+  virtual std::unique_ptr<GeoIpTicket> makeGeoIpTicket(const std::optional<std::string>& ipAddress) = 0;
+
+  // The country code of the shared country configuration, or nothing. Reads small files at most.
+  virtual std::optional<std::string> currentCountryCode() = 0;
+};
+
+}  // namespace brenvik

@@ -1,0 +1,184 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/geo/linux/Gazetteer.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+
+namespace brenvik {
+namespace {
+
+constexpr const char* kNone = nullptr;
+
+struct Case {
+  const char* name;
+  double latitude;
+  double longitude;
+  const char* country;  // null: nothing is known of the place
+  const char* area;
+  const char* city;
+};
+void PrintTo(const Case& place, std::ostream* out) { *out << place.name; }
+
+std::optional<std::string> text(const char* bytes) {
+  return bytes == nullptr ? std::nullopt : std::optional<std::string>(bytes);
+}
+
+class GazetteerPlaceTest : public testing::TestWithParam<Case> {};
+
+TEST_P(GazetteerPlaceTest, HasTheCountryOfItsBorderAndTheAreaAndCityOfItsNearestPlace) {
+  static Gazetteer gazetteer(GAZETTEER_DATABASE);
+  const Case& place = GetParam();
+  const auto answer = gazetteer.lookUp({place.latitude, place.longitude});
+  ASSERT_FALSE(answer.error) << answer.error->description;
+  if (place.country == kNone) {
+    EXPECT_FALSE(answer.address);
+    return;
+  }
+  ASSERT_TRUE(answer.address);
+  EXPECT_EQ(answer.address->countryCode, place.country);
+  EXPECT_EQ(answer.address->administrativeArea, text(place.area));
+  EXPECT_EQ(answer.address->locality, text(place.city));
+  EXPECT_EQ(answer.address->postCode, std::nullopt);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Borders, GazetteerPlaceTest,
+    testing::Values(
+        // An exclave of Germany in Switzerland; the nearest large towns are Swiss.
+        Case{"BuesingenIsGerman", 47.6968, 8.6876, "DE", "Baden-Wurttemberg", "Büsingen"},
+        // Belgian parcels in a Dutch town, and the Dutch town around them.
+        Case{"BaarleHertogIsBelgian", 51.4413, 4.9296, "BE", "Flanders", "Baarle-Hertog"},
+        Case{"BaarleNassauIsDutch", 51.4475, 4.9292, "NL", "North Brabant", "Baarle-Nassau"},
+        Case{"LliviaIsSpanish", 42.4646, 1.9807, "ES", "Catalonia", "Llívia"},
+        Case{"CampioneIsItalian", 45.9690, 8.9710, "IT", "Lombardy", "Campione"},
+        Case{"TheVaticanIsNotItaly", 41.9022, 12.4533, "VA", kNone, "Vatican City"},
+        Case{"MonacoIsNotFrance", 43.7384, 7.4246, "MC", "Municipality of Monaco", "Monte-Carlo"},
+        Case{"GenevaAirportIsSwiss", 46.2330, 6.1090, "CH", "Geneva", "Le Grand-Saconnex"},
+        Case{"FerneyIsFrench", 46.2558, 6.1081, "FR", "Auvergne-Rhône-Alpes", "Ferney-Voltaire"},
+        Case{"BaselIsSwiss", 47.5584, 7.5733, "CH", "Basel-City", "Basel"},
+        Case{"SaintLouisIsFrench", 47.5903, 7.5650, "FR", "Grand Est", "Saint-Louis"},
+        Case{"CeutaIsSpanish", 35.8892, -5.3204, "ES", "Ceuta", "Ceuta"},
+        Case{"NiagaraFallsIsCanadianWestOfTheRiver", 43.0896, -79.0849, "CA", "Ontario", "Niagara Falls"},
+        Case{"NiagaraFallsIsAmericanEastOfTheRiver", 43.0945, -79.0367, "US", "New York", "Niagara Falls"},
+        Case{"PointRobertsIsAmerican", 48.9854, -123.0780, "US", "Washington", "Point Roberts"},
+        Case{"TijuanaIsMexican", 32.5027, -117.0037, "MX", "Baja California", "Tijuana"},
+        Case{"SanYsidroIsAmerican", 32.5520, -117.0431, "US", "California", "Imperial Beach"},
+        Case{"SingaporeIsNotJohor", 1.4360, 103.7860, "SG", kNone, "Woodlands"},
+        Case{"JohorBahruIsMalaysian", 1.4655, 103.7578, "MY", "Johor", "Johor Bahru"},
+        Case{"KaliningradIsRussian", 54.7065, 20.5110, "RU", "Kaliningrad Oblast", "Kaliningrad"},
+        Case{"HaparandaIsSwedish", 65.8355, 24.1368, "SE", "Norrbotten", "Haparanda"}),
+    [](const auto& each) { return std::string(each.param.name); });
+
+INSTANTIATE_TEST_SUITE_P(
+    Coasts, GazetteerPlaceTest,
+    testing::Values(Case{"ABeachBelongsToItsCity", -22.9711, -43.1823, "BR", "Rio de Janeiro", "Copacabana"},
+                    Case{"AnIslandFortBelongsToItsCity", 42.3190, -70.9280, "US", "Massachusetts", "Hull"},
+                    Case{"NorthCape", 71.1710, 25.7840, "NO", "Finnmark", "Honningsvåg"},
+                    Case{"TheMiddleOfTheAtlanticIsNowhere", 30.0, -40.0, kNone, kNone, kNone},
+                    Case{"TheMiddleOfThePacificIsNowhere", 0.0, -140.0, kNone, kNone, kNone}),
+    [](const auto& each) { return std::string(each.param.name); });
+
+INSTANTIATE_TEST_SUITE_P(
+    EdgesOfTheMap, GazetteerPlaceTest,
+    testing::Values(Case{"TheSouthPole", -90.0, 0.0, "AQ", kNone, kNone},
+                    Case{"TheSouthPoleOnTheAntimeridian", -90.0, 180.0, "AQ", kNone, kNone},
+                    Case{"TheNorthPoleIsNowhere", 90.0, 0.0, kNone, kNone, kNone},
+                    Case{"TaveuniWestOfTheAntimeridian", -16.80, 179.99, "FJ", "Northern", kNone},
+                    Case{"TaveuniEastOfTheAntimeridian", -16.80, -179.99, "FJ", "Northern", kNone},
+                    Case{"TaveuniOnTheAntimeridian", -16.80, 180.0, "FJ", "Northern", kNone},
+                    Case{"TaveuniOnTheAntimeridianFromTheWest", -16.80, -180.0, "FJ", "Northern", kNone},
+                    Case{"ChukotkaEastOfTheAntimeridian", 66.15, -169.80, "RU", "Chukotka", kNone},
+                    Case{"WrangelIslandOnTheAntimeridian", 71.20, 180.0, "RU", kNone, kNone},
+                    Case{"AttuIsAmericanWestOfTheAntimeridian", 52.90, 172.90, "US", kNone, kNone},
+                    Case{"BigDiomedeIsRussian", 65.78, -169.06, "RU", "Chukotka", kNone},
+                    Case{"LittleDiomedeIsAmerican", 65.755, -168.92, "US", kNone, kNone}),
+    [](const auto& each) { return std::string(each.param.name); });
+
+class GazetteerFileTest : public testing::Test {
+ protected:
+  GazetteerFileTest() {
+    std::string name = (std::filesystem::temp_directory_path() / "brenvik-gazetteer-XXXXXX").string();
+    if (::mkdtemp(name.data()) == nullptr) std::abort();
+    folder = name;
+  }
+  ~GazetteerFileTest() override { std::filesystem::remove_all(folder); }
+  static std::string problemOf(const std::filesystem::path& path) {
+    Gazetteer gazetteer(path);
+    const auto answer = gazetteer.lookUp({59.9, 10.7});
+    EXPECT_FALSE(answer.address);
+    return answer.error ? answer.error->description : "none";
+  }
+  std::filesystem::path folder;
+};
+
+TEST_F(GazetteerFileTest, WithoutTheDatabaseALookUpIsAnError) {
+  EXPECT_EQ(problemOf(folder / "none.db"),
+            "the offline gazetteer cannot be read: unable to open database file");
+}
+
+TEST_F(GazetteerFileTest, TheDatabaseIsOpenedByTheFirstLookUpAndNotBefore) {
+  Gazetteer gazetteer(folder / "later.db");
+  EXPECT_TRUE(gazetteer.lookUp({59.9, 10.7}).error);
+  std::filesystem::create_symlink(GAZETTEER_DATABASE, folder / "later.db");
+  const auto answer = gazetteer.lookUp({59.9, 10.7});
+  ASSERT_TRUE(answer.address);
+  EXPECT_EQ(answer.address->countryCode, "NO");
+}
+
+TEST_F(GazetteerFileTest, APathMayHoldWhatAUriWouldMisread) {
+  const auto path = folder / "a?b#c%20d e.db";
+  std::filesystem::create_symlink(GAZETTEER_DATABASE, path);
+  Gazetteer gazetteer(path);
+  EXPECT_TRUE(gazetteer.lookUp({59.9, 10.7}).address);
+}
+
+TEST_F(GazetteerFileTest, AnotherDatabaseIsAnError) {
+  const auto path = folder / "other.db";
+  ASSERT_EQ(
+      SqliteDatabase::open(path, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE)->execute("create table t(a)"),
+      SQLITE_OK);
+  EXPECT_EQ(problemOf(path), "the offline gazetteer cannot be read: not a gazetteer of this version");
+}
+
+TEST_F(GazetteerFileTest, AFileThatIsNoDatabaseIsAnError) {
+  std::ofstream(folder / "text.db") << std::string(10000, 'x');
+  EXPECT_EQ(problemOf(folder / "text.db"),
+            "the offline gazetteer cannot be read: not a gazetteer of this version");
+}
+
+TEST_F(GazetteerFileTest, ADatabaseThatLostItsTablesIsAnError) {
+  const auto path = folder / "empty.db";
+  ASSERT_EQ(SqliteDatabase::open(path, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE)
+                ->execute("pragma application_id = 1115047777; pragma user_version = 1; create table t(a)"),
+            SQLITE_OK);
+  EXPECT_EQ(problemOf(path), "the offline gazetteer cannot be read: no such table: area");
+}
+
+TEST_F(GazetteerFileTest, ADamagedDatabaseIsAnErrorOrAnAnswerAndNeverACrash) {
+  const auto path = folder / "damaged.db";
+  std::filesystem::copy_file(GAZETTEER_DATABASE, path);
+  // Every page but the first is noise.
+  std::fstream file(path, std::ios::in | std::ios::out | std::ios::binary);
+  const auto size = std::filesystem::file_size(path);
+  for (std::uintmax_t at = 4096; at < size; at += 512) {
+    file.seekp(static_cast<std::streamoff>(at));
+    file << "noise noise noise";
+  }
+  file.close();
+  Gazetteer gazetteer(path);
+  const auto answer = gazetteer.lookUp({59.9, 10.7});
+  ASSERT_TRUE(answer.error);
+  EXPECT_EQ(answer.error->description.rfind("the offline gazetteer ", 0), 0U);
+}
+
+TEST_F(GazetteerFileTest, TheDatabaseIsSmallerThan24Megabytes) {
+  EXPECT_LT(std::filesystem::file_size(GAZETTEER_DATABASE), 24'000'000U);
+}
+
+}  // namespace
+}  // namespace brenvik

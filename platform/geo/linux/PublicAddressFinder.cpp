@@ -1,0 +1,63 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/geo/linux/PublicAddressFinder.h"
+
+#include <sys/eventfd.h>
+#include <sys/random.h>
+
+#include <utility>
+
+namespace brenvik {
+
+PublicAddressFinder::PublicAddressFinder(MakeNetwork makeNetwork, WorkQueue& mainQueue)
+    : makeNetwork_(std::move(makeNetwork)),
+      mainQueue_(mainQueue),
+      stopFd_(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {}
+
+void PublicAddressFinder::find(Deliver deliver, WorkQueue& queue) {
+  {
+    const std::lock_guard lock(mutex_);
+    waiting_.push_back(std::move(deliver));
+    // The transaction posted for the first of them takes all.
+    if (waiting_.size() > 1) return;
+  }
+  queue.post([weak = weak_from_this()] {
+    if (const auto self = weak.lock()) self->runTransaction();
+  });
+}
+
+void PublicAddressFinder::stop() noexcept {
+  {
+    const std::lock_guard lock(mutex_);
+    stopped_ = true;
+    waiting_.clear();
+  }
+  (void)::eventfd_write(stopFd_.get(), 1);  // its count is far from full
+}
+
+void PublicAddressFinder::runTransaction() {
+  std::vector<Deliver> asked;
+  {
+    const std::lock_guard lock(mutex_);
+    if (stopped_) return;
+    asked.swap(waiting_);
+  }
+  const StunOutcome found = outcome();
+  {
+    const std::lock_guard lock(mutex_);
+    if (stopped_) return;
+  }
+  for (const auto& deliver : asked) deliver(found);
+}
+
+StunOutcome PublicAddressFinder::outcome() {
+  if (mainQueue_.isCurrent()) return {{}, GeoError{"no thread to wait on"}};
+  StunTransactionId id{};
+  // An id that can be guessed would let anybody answer.
+  if (::getrandom(id.data(), id.size(), 0) != static_cast<ssize_t>(id.size())) {
+    return {{}, GeoError{"no random numbers"}};
+  }
+  return runStunTransaction(*makeNetwork_(stopFd_.get()), id);
+}
+
+}  // namespace brenvik

@@ -1,0 +1,119 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/geo/linux/SystemGeoService.h"
+
+#include <chrono>
+#include <utility>
+
+#include "platform/geo/linux/PublicAddressFinder.h"
+#include "platform/geo/linux/UdpStunNetwork.h"
+
+namespace brenvik {
+namespace {
+
+// Puts the answer on the queue that the question named, if that still exists.
+template <typename Handler, typename Answer>
+void answerOn(const std::weak_ptr<WorkQueue>& queue, const Handler& handler, std::optional<Answer> answer,
+              std::optional<GeoError> error) {
+  const auto alive = queue.lock();
+  if (alive == nullptr) return;
+  alive->post([handler, answer = std::move(answer), error = std::move(error)] { handler(answer, error); });
+}
+
+}  // namespace
+
+class SystemGeoService::ReverseTicket final : public ReverseGeocodeTicket {
+ public:
+  ReverseTicket(SystemGeoService& service, Coordinate coordinate)
+      : service_(service), coordinate_(coordinate) {}
+  void submit(ReverseGeocodeHandler handler, const GeoNetworkActivity*,
+              const std::shared_ptr<WorkQueue>& handlerQueue) override {
+    auto deliver = [handler = std::move(handler), handlerQueue = std::weak_ptr(handlerQueue)](
+                       std::optional<MapItems> items, std::optional<GeoError> error) {
+      answerOn(handlerQueue, handler, std::move(items), std::move(error));
+    };
+    const auto queue = service_.placesQueue();
+    queue->post([geocoder = service_.geocoder_, coordinate = coordinate_, deliver = std::move(deliver),
+                 weakQueue = std::weak_ptr(queue)] {
+      if (const auto alive = weakQueue.lock()) geocoder->lookUp(coordinate, deliver, alive);
+    });
+  }
+
+ private:
+  SystemGeoService& service_;
+  const Coordinate coordinate_;
+};
+
+class SystemGeoService::IpTicket final : public GeoIpTicket {
+ public:
+  IpTicket(SystemGeoService& service, bool ofThisDevice) : service_(service), ofThisDevice_(ofThisDevice) {}
+  void submit(GeoIpHandler handler, const AuditToken*, const GeoNetworkActivity*,
+              const std::shared_ptr<WorkQueue>& handlerQueue) override {
+    auto deliver = [handler = std::move(handler),
+                    handlerQueue = std::weak_ptr(handlerQueue)](const StunOutcome& found) {
+      std::optional<GeoIpResult> result;
+      if (found.address) result = GeoIpResult{*found.address};
+      answerOn(handlerQueue, handler, std::move(result), found.error);
+    };
+    if (!ofThisDevice_) return deliver({{}, GeoError{"only this device's own address can be looked up"}});
+    const std::lock_guard lock(service_.mutex_);
+    if (service_.addressQueue_ == nullptr) {
+      service_.addressQueue_ =
+          service_.queues_.makeSerial("geo service: address", QualityOfService::standard);
+    }
+    service_.addressFinder_->find(std::move(deliver), *service_.addressQueue_);
+  }
+
+ private:
+  SystemGeoService& service_;
+  const bool ofThisDevice_;
+};
+
+SystemGeoService::SystemGeoService(WorkQueues& queues, WebClient& webClient, Settings settings)
+    : queues_(queues),
+      country_(std::make_shared<CountryConfiguration>(std::move(settings.countryFiles))),
+      geocoder_(std::make_shared<ReverseGeocoder>(
+          std::move(settings.geocoderUrl), std::move(settings.gazetteer), webClient,
+          [] { return std::chrono::nanoseconds(std::chrono::steady_clock::now().time_since_epoch()); },
+          [country = country_](const std::string& code) { country->setLastGeocoded(code); })),
+      addressFinder_(std::make_shared<PublicAddressFinder>(
+          [server = std::move(settings.stunServer)](int stopFd) {
+            return std::make_unique<UdpStunNetwork>(server, stopFd);
+          },
+          queues.main())) {}
+
+SystemGeoService::~SystemGeoService() {
+  addressFinder_->stop();
+  geocoder_->close();
+  std::shared_ptr<WorkQueue> places;
+  std::shared_ptr<WorkQueue> addresses;
+  {
+    const std::lock_guard lock(mutex_);
+    places.swap(placesQueue_);
+    addresses.swap(addressQueue_);
+  }
+  // The queues join their threads here, without the lock.
+}
+
+std::shared_ptr<WorkQueue> SystemGeoService::placesQueue() {
+  const std::lock_guard lock(mutex_);
+  if (placesQueue_ == nullptr) {
+    placesQueue_ = queues_.makeSerial("geo service: places", QualityOfService::standard);
+  }
+  return placesQueue_;
+}
+
+std::unique_ptr<ReverseGeocodeTicket> SystemGeoService::makeReverseGeocodeTicket(Coordinate coordinate,
+                                                                                 IncludeEta, ShiftLocations,
+                                                                                 const GeoTraits*) {
+  // No route is planned here, and neither source has coordinates that would have to be shifted.
+  return std::make_unique<ReverseTicket>(*this, coordinate);
+}
+
+std::unique_ptr<GeoIpTicket> SystemGeoService::makeGeoIpTicket(const std::optional<std::string>& ipAddress) {
+  return std::make_unique<IpTicket>(*this, !ipAddress.has_value());
+}
+
+std::optional<std::string> SystemGeoService::currentCountryCode() { return country_->countryCode(); }
+
+}  // namespace brenvik

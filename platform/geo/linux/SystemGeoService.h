@@ -1,0 +1,61 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/geo/GeoService.h"
+#include "platform/geo/linux/CountryConfiguration.h"
+#include "platform/geo/linux/ReverseGeocoder.h"
+#include "platform/runloop/WorkQueue.h"
+#include "platform/web/WebClient.h"
+
+namespace brenvik {
+
+class PublicAddressFinder;
+
+// The geo service on Linux: addresses from a server or the offline gazetteer, the public address by STUN, the
+// country configuration from its file. Two queues of its own do the work, each made with the first question
+// for it.
+class SystemGeoService final : public GeoService {
+ public:
+  struct Settings {
+    std::string geocoderUrl;  // empty: none
+    std::string gazetteer;    // path of the offline database
+    std::string stunServer;   // host or host:port
+    CountryConfiguration::Files countryFiles;
+  };
+
+  // The references outlive this object; the web client is used only when there is a geocoder. Cheap: opens
+  // nothing.
+  SystemGeoService(WorkQueues& queues, WebClient& webClient, Settings settings);
+  SystemGeoService(const SystemGeoService&) = delete;
+  SystemGeoService& operator=(const SystemGeoService&) = delete;
+  // Ends what is under way without answering it; does not wait for the network.
+  ~SystemGeoService() override;
+
+  std::unique_ptr<ReverseGeocodeTicket> makeReverseGeocodeTicket(Coordinate coordinate, IncludeEta includeEta,
+                                                                 ShiftLocations shiftLocations,
+                                                                 const GeoTraits* traits) override;
+  std::unique_ptr<GeoIpTicket> makeGeoIpTicket(const std::optional<std::string>& ipAddress) override;
+  std::optional<std::string> currentCountryCode() override;
+
+ private:
+  class ReverseTicket;
+  class IpTicket;
+  std::shared_ptr<WorkQueue> placesQueue();
+
+  WorkQueues& queues_;
+  const std::shared_ptr<CountryConfiguration> country_;
+  const std::shared_ptr<ReverseGeocoder> geocoder_;
+  const std::shared_ptr<PublicAddressFinder> addressFinder_;
+  std::mutex mutex_;
+  std::shared_ptr<WorkQueue> placesQueue_;   // under mutex_
+  std::shared_ptr<WorkQueue> addressQueue_;  // under mutex_
+};
+
+}  // namespace brenvik
