@@ -4,8 +4,6 @@
 
 #include <gtest/gtest.h>
 
-#include "helper/core/UnbuiltRoutines.h"
-#include "helper/requests/RequestTable.h"
 #include "platform/baseband/fakes/FakeBaseband.h"
 #include "platform/ipc/fakes/FakePorts.h"
 #include "platform/log/fakes/RecordingLog.h"
@@ -15,6 +13,12 @@ namespace brenvik {
 namespace {
 
 using namespace std::chrono_literals;
+
+class NoRoutines final : public RoutineTable {
+ public:
+  Handler find(std::int32_t) const noexcept override { return nullptr; }
+  void* context() const noexcept override { return nullptr; }
+};
 
 class EntryPointTest : public testing::Test {
  protected:
@@ -38,8 +42,7 @@ class EntryPointTest : public testing::Test {
   PortServerRegistry registry;
   ServerPlatform platform{ports, bootstrap, sources, loop, [](const char*, const AuditToken&) { return true; },
                           registry};
-  UnbuiltRoutines routines;
-  RequestTable requests{routines};
+  NoRoutines requests;
   FakeBasebandLibrary baseband;
   RecordingLog log;
 };

@@ -4,23 +4,27 @@
 
 #include "Helper/Shared/Server/HelperServerUtils.h"
 #include "helper/carrier/CarrierOperations.h"
-#include "helper/core/UnbuiltRoutines.h"
+#include "helper/requests/ServerRoutines.h"
 #include "helper/heartbeat/CellularHeartbeat.h"
 #include "helper/labels/ChannelRemap.h"
 #include "helper/labels/LabelRoutines.h"
 #include "helper/lasd/LASDUpdater.h"
+#include "helper/location/LocationRoutines.h"
 #include "helper/mobile/RadioLogging.h"
 #include "helper/preferences/PreferenceTransfer.h"
+#include "helper/voicemail/VoicemailOperations.h"
 
 namespace brenvik {
 
 // Hands each server routine to the area that owns it.
-class HelperRoutines final : public UnbuiltRoutines {
+class HelperRoutines final : public ServerRoutines {
  public:
   // The areas; each outlives the routines.
   struct Areas {
     PreferenceTransfer& preferences;
     CarrierOperations& carrier;
+    VoicemailOperations& voicemail;
+    LocationRoutines& location;
     RadioLogging& radioLogging;
     LabelRoutines& labels;
     ChannelRemap& channelRemap;
@@ -30,6 +34,41 @@ class HelperRoutines final : public UnbuiltRoutines {
   };
   explicit HelperRoutines(const Areas& areas) noexcept : areas_(areas) {}
 
+  KernelReturn server_BVMobileHelperSetVoicemailToken(PortName port, char* token) override {
+    return areas_.voicemail.setVoicemailToken(port, token);
+  }
+  KernelReturn server_BVMobileHelperSetVoicemailTokenForKey(PortName port, char* key, char* token) override {
+    return areas_.voicemail.setVoicemailTokenForKey(port, key, token);
+  }
+  KernelReturn server_BVMobileHelperClearVoicemailToken(PortName port) override {
+    return areas_.voicemail.clearVoicemailToken(port);
+  }
+  KernelReturn server_BVMobileHelperResetVoicemailStore(PortName port) override {
+    return areas_.voicemail.resetVoicemailStore(port);
+  }
+  KernelReturn server_BVMobileHelperCopyVoicemailTokenForKey(PortName port, char* key, char* token) override {
+    return areas_.voicemail.copyVoicemailTokenForKey(port, key, token);
+  }
+  KernelReturn server_BVMobileHelperCopyVoicemailToken(PortName port, char* token) override {
+    return areas_.voicemail.copyVoicemailToken(port, token);
+  }
+  KernelReturn server_BVMobileHelperIsVoicemailServiceSubscribed(PortName port, std::uint8_t* subscribed) override {
+    return areas_.voicemail.isVoicemailServiceSubscribed(port, subscribed);
+  }
+  KernelReturn server_BVMobileHelperUnpackArchive(PortName port, char* archivePath, char* destinationPath,
+                                                  std::uint8_t* success) override {
+    return areas_.carrier.unpackArchive(port, archivePath, destinationPath, success);
+  }
+  KernelReturn server_BVMobileHelperRequestCountryCodeFromLocation(PortName port, double latitude,
+                                                                   double longitude) override {
+    return areas_.location.server_BVMobileHelperRequestCountryCodeFromLocation(port, latitude, longitude);
+  }
+  KernelReturn server_BVMobileHelperCopyCountryCode(PortName port, char* code) override {
+    return areas_.location.server_BVMobileHelperCopyCountryCode(port, code);
+  }
+  KernelReturn server_BVMobileHelperRequestWanIPFromLocation(PortName port) override {
+    return areas_.location.server_BVMobileHelperRequestWanIPFromLocation(port);
+  }
   KernelReturn server_BVMobileHelperSetPreferenceValue(PortName port, char* domain, char* key,
                                                        const void* value, std::uint32_t length) override {
     return areas_.preferences.setPreferenceValue(port, domain, key, value, length);

@@ -17,12 +17,15 @@
 #include "helper/core/EntryPoint.h"
 #include "helper/core/HelperRoutines.h"
 #include "helper/entitlement/EntitlementCheck.h"
+#include "helper/location/GeoRequestState.h"
 #include "helper/mobile/MobileUser.h"
 #include "helper/requests/RequestTable.h"
 #include "platform/accounts/linux/PasswordDatabase.h"
 #include "platform/baseband/linux/LoadedBasebandLibrary.h"
 #include "platform/contacts/linux/SqliteContacts.h"
 #include "platform/files/linux/LinuxFileManager.h"
+#include "platform/files/linux/ZipArchiveCopier.h"
+#include "platform/geo/linux/SystemGeoService.h"
 #include "platform/ipc/linux/SystemBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/labeler/linux/CatalogueLabeler.h"
@@ -33,6 +36,9 @@
 #include "platform/radio/linux/ModemManagerLogs.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/security/linux/EntitlementFiles.h"
+#include "platform/telephony/linux/ChannelTelephonyDaemon.h"
+#include "platform/voicemail/linux/DynamicVisualVoicemail.h"
+#include "platform/voicemail/linux/SqliteVoicemailStore.h"
 #include "platform/web/linux/LoadedWebModule.h"
 
 namespace brenvik {
@@ -87,7 +93,7 @@ int run() {
     return MobileAccount{mobile.homeDirectory(), mobile.uid(), mobile.gid()};
   };
   PathPolicy policy(mobileAccount);
-  CarrierOperations carrier(FileSystemManager::factory(files), [] { return nullptr; }, policy, preferences,
+  CarrierOperations carrier(FileSystemManager::factory(files), ZipArchiveCopier::factory(), policy, preferences,
                             mobileAccount);
   ModemManagerLogs radio(queues);
   RadioLogging radioLogging(radio);
@@ -109,8 +115,24 @@ int run() {
   CellularHeartbeat& heartbeat = CellularHeartbeat::shared();
   heartbeat.configure({.queues = queues, .network = echoNetwork});
 
+  SqliteVoicemailStore voicemailStore([&mobile, mobileHome] {
+    return SqliteVoicemailStore::Account{mobileHome(), mobile.uid(), mobile.gid()};
+  });
+  DynamicVisualVoicemail visualVoicemail(BRENVIK_VISUAL_VOICEMAIL_LIBRARY, BRENVIK_VISUAL_VOICEMAIL_SYMBOL);
+  VoicemailOperations voicemail(voicemailStore, visualVoicemail);
+
+  SystemGeoService geoService(queues, web.webClient(),
+                              {.geocoderUrl = BRENVIK_GEOCODER_URL,
+                               .gazetteer = BRENVIK_GAZETTEER,
+                               .stunServer = BRENVIK_STUN_SERVER,
+                               .countryFiles = {.configuration = BRENVIK_COUNTRY_CONFIGURATION}});
+  ChannelTelephonyDaemon telephonyDaemon(BRENVIK_BOOTSTRAP_DIRECTORY);
+  LocationRoutines location(queues, geoService, telephonyDaemon, GeoRequestState::shared());
+
   HelperRoutines routines({.preferences = preferenceTransfer,
                            .carrier = carrier,
+                           .voicemail = voicemail,
+                           .location = location,
                            .radioLogging = radioLogging,
                            .labels = labels,
                            .channelRemap = channelRemap,

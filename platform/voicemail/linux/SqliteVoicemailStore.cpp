@@ -3,7 +3,6 @@
 #include "platform/voicemail/linux/SqliteVoicemailStore.h"
 
 #include <fcntl.h>
-#include <sqlite3.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -15,6 +14,7 @@
 
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
+#include "platform/sqlite/Sqlite.h"
 
 namespace brenvik {
 namespace {
@@ -50,68 +50,67 @@ class SqliteVoicemailStore::Database {
  public:
   // SQLITE_OK or SQLite's extended code.
   int open(const std::string& file) {
+    if (sqlite() == nullptr) return SQLITE_CANTOPEN;  // the library is not there
     sqlite3* opened = nullptr;
-    const int code = ::sqlite3_open_v2(file.c_str(), &opened,
+    const int code = sqlite()->open_v2(file.c_str(), &opened,
                                        SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOFOLLOW | SQLITE_OPEN_EXRESCODE |
                                            SQLITE_OPEN_PRIVATECACHE | SQLITE_OPEN_NOMUTEX,
                                        nullptr);
     handle_.reset(opened);
     if (code != SQLITE_OK) return code;
     // The file belongs to an ordinary account: nothing in its schema is believed.
-    ::sqlite3_db_config(opened, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
-    ::sqlite3_db_config(opened, SQLITE_DBCONFIG_TRUSTED_SCHEMA, 0, nullptr);
-    ::sqlite3_db_config(opened, SQLITE_DBCONFIG_ENABLE_TRIGGER, 0, nullptr);
-    ::sqlite3_db_config(opened, SQLITE_DBCONFIG_ENABLE_VIEW, 0, nullptr);
-    ::sqlite3_busy_timeout(opened, kBusyMilliseconds);
+    sqlite()->db_config(opened, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
+    sqlite()->db_config(opened, SQLITE_DBCONFIG_TRUSTED_SCHEMA, 0, nullptr);
+    sqlite()->db_config(opened, SQLITE_DBCONFIG_ENABLE_TRIGGER, 0, nullptr);
+    sqlite()->db_config(opened, SQLITE_DBCONFIG_ENABLE_VIEW, 0, nullptr);
+    sqlite()->busy_timeout(opened, kBusyMilliseconds);
     const int failed = execute("PRAGMA journal_mode=DELETE; PRAGMA synchronous=FULL;");
     return failed != SQLITE_OK ? failed : execute(kSchema);
   }
 
   int execute(const char* statements) {
-    return ::sqlite3_exec(handle_.get(), statements, nullptr, nullptr, nullptr);
+    return sqlite()->exec(handle_.get(), statements, nullptr, nullptr, nullptr);
   }
 
   // Runs one statement with up to two texts bound; *result gets the first column of the first row, if any.
   int run(const char* statement, const std::string* first, const std::string* second,
           std::optional<std::string>* result) {
     sqlite3_stmt* prepared = nullptr;
-    int code = ::sqlite3_prepare_v2(handle_.get(), statement, -1, &prepared, nullptr);
-    const std::unique_ptr<sqlite3_stmt, decltype(&::sqlite3_finalize)> owner(prepared, &::sqlite3_finalize);
+    int code = sqlite()->prepare_v3(handle_.get(), statement, -1, 0, &prepared, nullptr);
+    const SqliteStatement owner(prepared);
     if (code != SQLITE_OK) return code;
     int index = 0;
     for (const std::string* text : {first, second}) {
       if (text == nullptr) continue;
       code =
-          ::sqlite3_bind_text(prepared, ++index, text->data(), static_cast<int>(text->size()), SQLITE_STATIC);
+          sqlite()->bind_text(prepared, ++index, text->data(), static_cast<int>(text->size()), SQLITE_STATIC);
       if (code != SQLITE_OK) return code;
     }
-    code = ::sqlite3_step(prepared);
-    if (code == SQLITE_ROW && result != nullptr && ::sqlite3_column_type(prepared, 0) == SQLITE_TEXT) {
-      const unsigned char* const text = ::sqlite3_column_text(prepared, 0);
+    code = sqlite()->step(prepared);
+    if (code == SQLITE_ROW && result != nullptr && sqlite()->column_type(prepared, 0) == SQLITE_TEXT) {
+      const unsigned char* const text = sqlite()->column_text(prepared, 0);
       if (text == nullptr) return SQLITE_NOMEM;
       result->emplace(reinterpret_cast<const char*>(text),
-                      static_cast<std::size_t>(::sqlite3_column_bytes(prepared, 0)));
+                      static_cast<std::size_t>(sqlite()->column_bytes(prepared, 0)));
     }
     return code == SQLITE_ROW || code == SQLITE_DONE ? SQLITE_OK : code;
   }
 
  private:
-  struct Close {
-    void operator()(sqlite3* handle) const noexcept { ::sqlite3_close_v2(handle); }
-  };
-  std::unique_ptr<sqlite3, Close> handle_;
+  SqliteDatabase handle_;
 };
 
 // Makes the folders and the empty file, each with its owner and mode, and gives the file's path. SQLite
 // refuses a path with a link in it, so links above the home are resolved first.
 bool SqliteVoicemailStore::makePlace(std::string* file, IfMissing ifMissing) {
-  if (home_.empty()) return false;
-  const std::unique_ptr<char, decltype(&std::free)> home(::realpath(home_.c_str(), nullptr), &std::free);
+  const Account account = account_();
+  if (account.home.empty()) return false;
+  const std::unique_ptr<char, decltype(&std::free)> home(::realpath(account.home.c_str(), nullptr), &std::free);
   if (!home) return false;
   const bool create = ifMissing == IfMissing::create;
   const UniqueFd top(::open(home.get(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-  const UniqueFd library = enterDirectory(top.get(), "Library", 0755, uid_, gid_, create);
-  const UniqueFd folder = enterDirectory(library.get(), "Voicemail", 0700, uid_, gid_, create);
+  const UniqueFd library = enterDirectory(top.get(), "Library", 0755, account.uid, account.gid, create);
+  const UniqueFd folder = enterDirectory(library.get(), "Voicemail", 0700, account.uid, account.gid, create);
   if (!folder.isValid()) return false;
   UniqueFd database(::openat(folder.get(), "voicemail.db", O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
   if (!database.isValid() && errno == ENOENT && create) {
@@ -121,8 +120,8 @@ bool SqliteVoicemailStore::makePlace(std::string* file, IfMissing ifMissing) {
   struct stat info {};
   if (!database.isValid() || ::fstat(database.get(), &info) != 0 || !S_ISREG(info.st_mode)) return false;
   // The journal takes its owner and mode from the database. Of a name elsewhere nothing is given away.
-  if ((info.st_uid != uid_ || info.st_gid != gid_) && info.st_nlink == 1 &&
-      ::fchown(database.get(), uid_, gid_) != 0) {
+  if ((info.st_uid != account.uid || info.st_gid != account.gid) && info.st_nlink == 1 &&
+      ::fchown(database.get(), account.uid, account.gid) != 0) {
     return false;
   }
   if ((info.st_mode & 07777) != 0600 && ::fchmod(database.get(), 0600) != 0) return false;

@@ -4,11 +4,11 @@
 
 #include <sys/types.h>
 
+#include <functional>
+#include <optional>
 #include <string>
 
 #include "platform/voicemail/VoicemailStore.h"
-
-struct sqlite3;
 
 namespace brenvik {
 
@@ -17,9 +17,17 @@ namespace brenvik {
 // that is damaged is moved aside, to voicemail.db.damaged, and a new one made.
 class SqliteVoicemailStore final : public VoicemailStore {
  public:
-  // `home` empty: the account has none, and the store is always empty.
+  struct Account {
+    std::string home;  // empty: the account has none, and the store is always empty
+    uid_t uid;
+    gid_t gid;
+  };
+
+  // `account` is asked by each operation, so that nothing is looked up before the first; it may throw
+  // std::bad_alloc.
+  explicit SqliteVoicemailStore(std::function<Account()> account) : account_(std::move(account)) {}
   SqliteVoicemailStore(std::string home, uid_t uid, gid_t gid)
-      : home_(std::move(home)), uid_(uid), gid_(gid) {}
+      : account_([account = Account{std::move(home), uid, gid}] { return account; }) {}
 
   void setToken(const std::string* token) noexcept override;
   void setTokenForKey(const std::string& key, const std::string& token) noexcept override;
@@ -35,9 +43,7 @@ class SqliteVoicemailStore final : public VoicemailStore {
   void write(const char* statement, const std::string* first, const std::string* second) noexcept;
   std::optional<std::string> read(const char* statement, const std::string* key) noexcept;
 
-  const std::string home_;
-  const uid_t uid_;
-  const gid_t gid_;
+  const std::function<Account()> account_;
 };
 
 }  // namespace brenvik
