@@ -237,13 +237,16 @@ bool compareRequests(int pairs) {
 }
 
 bool measureLookUps(const char* path, int count) {
-  auto database = SqliteDatabase::open(path, SQLITE_OPEN_READONLY);
-  if (!database) {
+  sqlite3* handle = nullptr;
+  const bool opened =
+      sqlite() != nullptr && sqlite()->open_v2(path, &handle, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK;
+  const SqliteDatabase database(handle);
+  if (!opened) {
     std::fprintf(stderr, "%s cannot be opened\n", path);
     std::exit(2);
   }
   std::vector<Coordinate> places;
-  auto all = database->prepare("select min_lat, min_lng from place_at");
+  Query all(*sqlite(), handle, "select min_lat, min_lng from place_at");
   while (all.step() == SQLITE_ROW) {
     places.push_back({static_cast<double>(all.integer(0)) / 1e5, static_cast<double>(all.integer(1)) / 1e5});
   }
@@ -259,7 +262,7 @@ bool measureLookUps(const char* path, int count) {
   Gazetteer gazetteer(path);
   Times times;
   Times bare;
-  auto row = database->prepare("select name from place where id = ?1");
+  Query row(*sqlite(), handle, "select name from place where id = ?1");
   for (int round = 0; round < 2; ++round) {  // the first warms the caches up
     times.clear();
     bare.clear();

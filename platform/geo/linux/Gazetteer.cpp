@@ -88,13 +88,27 @@ bool goesAround(std::span<const std::byte> ring, std::int64_t lng, std::int64_t 
 
 bool Gazetteer::open(std::string& error) {
   if (opened_) return true;
+  const SqliteFunctions* const functions = sqlite();
+  if (functions == nullptr) {
+    error = "SQLite cannot be loaded";
+    return false;
+  }
   // Immutable: nobody writes it, so there is nothing to lock and no journal to look for.
-  auto database = SqliteDatabase::open("file:" + percentEncoded(path_) + "?immutable=1",
-                                       SQLITE_OPEN_READONLY | SQLITE_OPEN_URI | SQLITE_OPEN_NOMUTEX, &error);
-  if (!database) return false;
+  sqlite3* handle = nullptr;
+  const int code = functions->open_v2(("file:" + percentEncoded(path_) + "?immutable=1").c_str(), &handle,
+                                      SQLITE_OPEN_READONLY | SQLITE_OPEN_URI | SQLITE_OPEN_NOMUTEX, nullptr);
+  SqliteDatabase database(handle);
+  if (code != SQLITE_OK) {
+    error = functions->errstr(code);
+    return false;
+  }
+  // Whoever could write the file could otherwise have its views and functions run here, with our rights.
+  (void)functions->db_config(handle, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
+  (void)functions->db_config(handle, SQLITE_DBCONFIG_TRUSTED_SCHEMA, 0, nullptr);
+
   const auto number = [&](const char* sql) {
-    auto statement = database->prepare(sql);
-    return statement.isValid() && statement.step() == SQLITE_ROW ? statement.integer(0) : -1;
+    Query query(*functions, handle, sql);
+    return query.isValid() && query.step() == SQLITE_ROW ? query.integer(0) : -1;
   };
   if (number("pragma application_id") != kApplicationId || number("pragma user_version") != kFormat) {
     error = "not a gazetteer of this version";
@@ -107,15 +121,13 @@ bool Gazetteer::open(std::string& error) {
   constexpr std::string_view kPlaces =
       "select a.min_lng, a.min_lat, p.name, p.country, p.area from place_at a join place p on p.id = a.id "
       "where a.min_lng >= ?1 and a.max_lng <= ?2 and a.min_lat >= ?3 and a.max_lat <= ?4";
-  Opened opened{std::move(*database), {}, {}, {}, {}};
-  opened.rings = opened.database.prepare(kRings);
-  opened.places = opened.database.prepare(kPlaces);
-  opened.placesOfCountry =
-      opened.database.prepare(std::string(kPlaces) + " and (p.country = ?5 or p.border = ?5)");
-  opened.area = opened.database.prepare("select name from area where id = ?1");
+  const std::string placesOfCountry = std::string(kPlaces) + " and (p.country = ?5 or p.border = ?5)";
+  Opened opened{std::move(database), Query(*functions, handle, kRings), Query(*functions, handle, kPlaces),
+                Query(*functions, handle, placesOfCountry),
+                Query(*functions, handle, "select name from area where id = ?1")};
   if (!opened.rings.isValid() || !opened.places.isValid() || !opened.placesOfCountry.isValid() ||
       !opened.area.isValid()) {
-    error = opened.database.errorText();
+    error = functions->errmsg(handle);
     return false;
   }
   opened_ = std::move(opened);
@@ -143,7 +155,9 @@ Gazetteer::Answer Gazetteer::lookUp(Coordinate coordinate) {
     answer.address = std::move(address);
   }
   if (failed_)
-    return {{}, GeoError{std::string("the offline gazetteer is damaged: ") + opened_->database.errorText()}};
+    return {{},
+            GeoError{std::string("the offline gazetteer is damaged: ") +
+                     sqlite()->errmsg(opened_->database.get())}};
   return answer;
 }
 
@@ -212,7 +226,7 @@ std::optional<Gazetteer::Place> Gazetteer::nearestPlace(Position position, const
 
 void Gazetteer::searchBox(Position position, const std::string* country, std::int64_t west, std::int64_t east,
                           std::int64_t south, std::int64_t north, std::optional<Place>& nearest) {
-  SqliteStatement& statement = country != nullptr ? opened_->placesOfCountry : opened_->places;
+  Query& statement = country != nullptr ? opened_->placesOfCountry : opened_->places;
   statement.bind(1, west);
   statement.bind(2, east);
   statement.bind(3, south);

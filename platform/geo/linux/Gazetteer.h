@@ -6,6 +6,7 @@
 #include <string>
 
 #include "platform/geo/GeoService.h"
+#include "platform/geo/linux/Query.h"
 #include "platform/sqlite/Sqlite.h"
 
 namespace brenvik {
@@ -51,10 +52,10 @@ class Gazetteer {
   // The statements go before their database does.
   struct Opened {
     SqliteDatabase database;
-    SqliteStatement rings;
-    SqliteStatement places;
-    SqliteStatement placesOfCountry;
-    SqliteStatement area;
+    Query rings;
+    Query places;
+    Query placesOfCountry;
+    Query area;
   };
   std::optional<Opened> opened_;
   bool failed_ = false;  // a statement of this look-up met an error

@@ -113,6 +113,14 @@ class GazetteerFileTest : public testing::Test {
     EXPECT_FALSE(answer.address);
     return answer.error ? answer.error->description : "none";
   }
+  static void makeDatabase(const std::filesystem::path& path, const char* sql) {
+    sqlite3* handle = nullptr;
+    const int code =
+        sqlite()->open_v2(path.c_str(), &handle, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
+    const SqliteDatabase database(handle);
+    ASSERT_EQ(code, SQLITE_OK);
+    ASSERT_EQ(sqlite()->exec(handle, sql, nullptr, nullptr, nullptr), SQLITE_OK);
+  }
   std::filesystem::path folder;
 };
 
@@ -139,9 +147,7 @@ TEST_F(GazetteerFileTest, APathMayHoldWhatAUriWouldMisread) {
 
 TEST_F(GazetteerFileTest, AnotherDatabaseIsAnError) {
   const auto path = folder / "other.db";
-  ASSERT_EQ(
-      SqliteDatabase::open(path, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE)->execute("create table t(a)"),
-      SQLITE_OK);
+  makeDatabase(path, "create table t(a)");
   EXPECT_EQ(problemOf(path), "the offline gazetteer cannot be read: not a gazetteer of this version");
 }
 
@@ -153,9 +159,7 @@ TEST_F(GazetteerFileTest, AFileThatIsNoDatabaseIsAnError) {
 
 TEST_F(GazetteerFileTest, ADatabaseThatLostItsTablesIsAnError) {
   const auto path = folder / "empty.db";
-  ASSERT_EQ(SqliteDatabase::open(path, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE)
-                ->execute("pragma application_id = 1115047777; pragma user_version = 1; create table t(a)"),
-            SQLITE_OK);
+  makeDatabase(path, "pragma application_id = 1115047777; pragma user_version = 1; create table t(a)");
   EXPECT_EQ(problemOf(path), "the offline gazetteer cannot be read: no such table: area");
 }
 

@@ -1,0 +1,65 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <span>
+#include <string_view>
+#include <utility>
+
+#include "platform/sqlite/Sqlite.h"
+
+namespace brenvik {
+
+// A prepared statement that is run again and again. Parameters count from 1, columns from 0; codes are
+// SQLite's. It must not outlive its database.
+class Query {
+ public:
+  Query() = default;
+  // Not valid when SQLite refuses the text.
+  Query(const SqliteFunctions& functions, sqlite3* database, std::string_view sql) noexcept
+      : sqlite_(&functions) {
+    sqlite3_stmt* statement = nullptr;
+    (void)functions.prepare_v3(database, sql.data(), static_cast<int>(sql.size()), SQLITE_PREPARE_PERSISTENT,
+                               &statement, nullptr);
+    statement_.reset(statement);
+  }
+
+  bool isValid() const noexcept { return statement_ != nullptr; }
+  void bind(int parameter, std::int64_t value) noexcept {
+    (void)sqlite_->bind_int64(statement_.get(), parameter, value);
+  }
+  // The text is copied.
+  void bind(int parameter, std::string_view value) noexcept {
+    (void)sqlite_->bind_text(statement_.get(), parameter, value.data(), static_cast<int>(value.size()),
+                             SQLITE_TRANSIENT);
+  }
+  // SQLITE_ROW, SQLITE_DONE or an error.
+  int step() noexcept { return sqlite_->step(statement_.get()); }
+  // Makes it ready to run again; the bindings stay.
+  void reset() noexcept { (void)sqlite_->reset(statement_.get()); }
+
+  // Of the present row; views hold until the next step or reset.
+  bool isNull(int column) const noexcept {
+    return sqlite_->column_type(statement_.get(), column) == SQLITE_NULL;
+  }
+  std::int64_t integer(int column) const noexcept { return sqlite_->column_int64(statement_.get(), column); }
+  std::string_view text(int column) const noexcept {
+    const auto* bytes = reinterpret_cast<const char*>(sqlite_->column_text(statement_.get(), column));
+    return {bytes, bytes == nullptr ? 0 : size(column)};
+  }
+  std::span<const std::byte> blob(int column) const noexcept {
+    const auto* bytes = static_cast<const std::byte*>(sqlite_->column_blob(statement_.get(), column));
+    return {bytes, bytes == nullptr ? 0 : size(column)};
+  }
+
+ private:
+  std::size_t size(int column) const noexcept {
+    return static_cast<std::size_t>(sqlite_->column_bytes(statement_.get(), column));
+  }
+  const SqliteFunctions* sqlite_ = nullptr;
+  SqliteStatement statement_;
+};
+
+}  // namespace brenvik
