@@ -76,7 +76,7 @@ class HostileClients(HelperTest):
         self.assertEqual(bad.channel.status(inline + b"\0"), -304)
         for fd in (*unsealed, sealed, zero):
             os.close(fd)
-        self.assertEqual(self.daemon.descriptors(), before)
+        eventually(lambda: self.daemon.descriptors() <= before, what="every descriptor being closed")
         self.assert_served()
 
     def test_a_client_that_never_reads_delays_nobody_but_itself(self):
@@ -99,6 +99,7 @@ class HostileClients(HelperTest):
             self.assertGreater(len(reply), 30000)
 
     def test_a_client_that_is_stopped_or_killed_in_the_middle_is_not_noticed(self):
+        self.assert_served()
         before = self.daemon.descriptors()
         for what in (signal.SIGSTOP, signal.SIGKILL):
             pid = os.fork()
@@ -109,25 +110,27 @@ class HostileClients(HelperTest):
                         client.channel.send(wire.simple("CopyPreferenceValue", wire.field("d", 256), wire.field("k", 256)))
                 finally:
                     os._exit(1)
-            eventually(lambda: self.daemon.descriptors() > before, what="a second client")
+            eventually(lambda: self.daemon.descriptors() >= before + 3, what="a second client")
             os.kill(pid, what)
             for _ in range(20):
                 self.assert_served()
             os.kill(pid, signal.SIGKILL)
             os.waitpid(pid, 0)
-            eventually(lambda: self.daemon.descriptors() == before, what="its descriptors going back")
+            eventually(lambda: self.daemon.descriptors() <= before, what="its descriptors going back")
 
     def test_half_a_check_in_and_hundreds_of_silent_connections_crowd_nobody_out(self):
-        def crowd():
+        def silent_crowd():
             connections = [wire.connect() for _ in range(300)]
             connections[-1].send(wire.check_in_message()[:30])
             time.sleep(0.2)
+            for connection in connections:
+                connection.close()
             return 0
         pids = []
         for account in ("stranger", "mobile"):
             pid = os.fork()
             if pid == 0:
-                os._exit(as_account(account, crowd))
+                os._exit(as_account(account, silent_crowd))
             pids.append(pid)
         for _ in range(20):
             wire.Client().close()
@@ -147,7 +150,7 @@ class HostileClients(HelperTest):
         before, memory = self.daemon.descriptors(), self.daemon.resident_kib()
         for _ in range(2):
             crowd()
-        eventually(lambda: self.daemon.descriptors() == before, what="the descriptors going back")
+        eventually(lambda: self.daemon.descriptors() <= before, what="the descriptors going back")
         self.assertLess(self.daemon.resident_kib() - memory, 1024)
         self.assert_served()
 
