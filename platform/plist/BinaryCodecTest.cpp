@@ -6,8 +6,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cmath>
+#include <ctime>
 #include <functional>
 
 #include "platform/plist/PropertyListCodec.h"
@@ -64,6 +64,13 @@ constexpr long kHeldBack =
 #else
 constexpr long kHeldBack = 0;
 #endif
+
+// Of this process, which other work on the machine does not lengthen.
+double processorSeconds(const std::function<void()>& work) {
+  const std::clock_t start = std::clock();
+  work();
+  return static_cast<double>(std::clock() - start) / CLOCKS_PER_SEC;
+}
 
 // Most memory, in KiB, that a process of its own needs for the work beyond what it needs for none.
 long peakMemory(const std::function<void()>& work) {
@@ -308,15 +315,16 @@ TEST(BinaryReaderTest, RefusesATinyFileThatWouldBeHugeAsXmlAtOnceAndInLittleMemo
   ASSERT_LT(hundredsOfMegabytes.size(), 140u);
   const std::string beyondCounting = bomb(200, 30);
   for (const std::string& hostile : {hundredsOfMegabytes, beyondCounting, bomb(250, 2), bomb(60, 100)}) {
-    const auto start = std::chrono::steady_clock::now();
-    EXPECT_FALSE(parse(hostile));
-    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
+    EXPECT_LT(processorSeconds([&] { EXPECT_FALSE(parse(hostile)); }), 0.5);
     EXPECT_LT(peakMemory([&] { (void)parse(hostile); }), 4 * 1024);
   }
   EXPECT_TRUE(parse(bomb(4, 10))) << "sharing within the limit is fine";
 }
 
 TEST(BinaryReaderTest, ASharedExpansionIsMeasuredToTheByte) {
+#ifdef __SANITIZE_THREAD__
+  GTEST_SKIP() << "64 MiB a byte at a time, and no second thread";
+#endif
   // One of everything, many times over, and a text that fills the form up to its last byte.
   const PropertyList everything = PropertyList::array(
       {PropertyList::integer(-12345), PropertyList::unsignedInteger(UINT64_MAX), PropertyList::real(-0.1),
@@ -510,10 +518,9 @@ TEST(BinaryWriterTest, FindsAPathThatIsTooDeepThroughSharedParts) {
 TEST(BinaryWriterTest, AnExponentialValueIsRefusedInBothFormatsAtOnce) {
   PropertyList value = PropertyList::array({PropertyList::array({})});
   for (int i = 0; i < 400; ++i) value = PropertyList::array({value, value});
-  const auto start = std::chrono::steady_clock::now();
-  EXPECT_FALSE(serializePropertyList(value, PropertyListFormat::xml));
-  EXPECT_FALSE(serializePropertyList(value, PropertyListFormat::binary));
-  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
+  for (const PropertyListFormat format : {PropertyListFormat::xml, PropertyListFormat::binary}) {
+    EXPECT_LT(processorSeconds([&] { EXPECT_FALSE(serializePropertyList(value, format)); }), 10);
+  }
 }
 
 }  // namespace
