@@ -46,9 +46,7 @@ inline constexpr const char kPostalCodeKey[] = "PostalCode";
 inline constexpr const char kAddressKey[] = "Address";
 
 // A notification has no struct of its own: a header with this id and no reply port, then a binary property
-// list to the end of the datagram, a dictionary of these keys, strings.
+// list to the end of the datagram.
 inline constexpr std::int32_t kNotificationMessageId = 0;
-inline constexpr const char kNotificationKey[] = "Notification";
-inline constexpr const char kDatabaseTypeKey[] = "DBType";  // absent in some
 
 }  // namespace brenvik

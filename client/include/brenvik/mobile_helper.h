@@ -17,8 +17,8 @@
  * never raised, every descriptor is close-on-exec. After fork() only one of the two processes may go on
  * using an object.
  *
- * Texts are UTF-8 and end with a NUL. Paths are read by the helper, in its own working directory and under its
- * own account: give absolute ones.
+ * Texts are UTF-8 and end with a NUL. Paths are read by the helper, in its own working directory and under
+ * its own account: give absolute ones.
  */
 
 #include <stdbool.h>
@@ -50,12 +50,12 @@ enum {
 
   /* answered by the helper */
   BVMH_NO_SPACE = 3,
-  BVMH_FAILURE = 5,            /* bad text, bad property list, or the work itself failed */
-  BVMH_RESOURCE_SHORTAGE = 6,  /* the helper is out of memory or descriptors */
-  BVMH_NO_ACCESS = 8,          /* the path is outside the places that the routine may touch */
-  BVMH_MEMORY_FAILURE = 9,     /* the file gave no property list */
-  BVMH_INVALID_SECURITY = 35,  /* the caller lacks the entitlement */
-  BVMH_NOT_SUPPORTED = 46,     /* not in this build of the helper */
+  BVMH_FAILURE = 5,           /* bad text, bad property list, or the work itself failed */
+  BVMH_RESOURCE_SHORTAGE = 6, /* the helper is out of memory or descriptors */
+  BVMH_NO_ACCESS = 8,         /* the path is outside the places that the routine may touch */
+  BVMH_MEMORY_FAILURE = 9,    /* the file gave no property list */
+  BVMH_INVALID_SECURITY = 35, /* the caller lacks the entitlement */
+  BVMH_NOT_SUPPORTED = 46,    /* not in this build of the helper */
   BVMH_TYPE_ERROR = -300,
   BVMH_BAD_ID = -303,
   BVMH_BAD_ARGUMENTS = -304,
@@ -63,17 +63,17 @@ enum {
 
   /* the transport's own */
   BVMH_ERROR_FIRST = -7099,
-  BVMH_ERROR_INVALID_ARGUMENT = -7001, /* a null pointer, a text that does not fit its field; nothing was sent */
-  BVMH_ERROR_NO_MEMORY = -7002,
-  BVMH_ERROR_NOT_CONNECTED = -7003, /* bvmh_connect was not called, or failed; nothing was sent */
-  BVMH_ERROR_UNREACHABLE = -7004,   /* nobody answers at the socket: see bvmh_client_errno */
-  BVMH_ERROR_TIMED_OUT = -7005,     /* no answer in time; a request that was sent may still be carried out */
-  BVMH_ERROR_HELPER_GONE = -7006,   /* the helper left before it took the request: not carried out */
-  BVMH_ERROR_ANSWER_LOST = -7007,   /* the helper left without answering: the request may have been carried out */
-  BVMH_ERROR_PROTOCOL = -7008,      /* the answer breaks the protocol; it was discarded, and the channel with it */
-  BVMH_ERROR_SYSTEM = -7009,        /* a system call failed: see bvmh_client_errno */
-  BVMH_ERROR_NAME_IN_USE = -7010,   /* listener: another live process serves the name */
   BVMH_ERROR_NO_LONGER_THERE = -7011, /* listener: the sender of the push has gone */
+  BVMH_ERROR_NAME_IN_USE = -7010,     /* listener: another live process serves the name */
+  BVMH_ERROR_SYSTEM = -7009,          /* a system call failed: see bvmh_client_errno */
+  BVMH_ERROR_PROTOCOL = -7008,        /* the answer breaks the protocol; the channel was closed */
+  BVMH_ERROR_ANSWER_LOST = -7007,     /* the helper left without answering: it may have been carried out */
+  BVMH_ERROR_HELPER_GONE = -7006,     /* the helper left before it took the request: not carried out */
+  BVMH_ERROR_TIMED_OUT = -7005,       /* no answer in time; what was sent may still be carried out */
+  BVMH_ERROR_UNREACHABLE = -7004,     /* nobody answers at the socket: see bvmh_client_errno */
+  BVMH_ERROR_NOT_CONNECTED = -7003,   /* no bvmh_connect, or it failed; nothing was sent */
+  BVMH_ERROR_NO_MEMORY = -7002,
+  BVMH_ERROR_INVALID_ARGUMENT = -7001, /* a null pointer, or a text too long; nothing was sent */
   BVMH_ERROR_LAST = -7001
 };
 
@@ -139,10 +139,10 @@ BVMH_API void bvmh_region_free(bvmh_region* region);
 
 /*
  * One function a routine. Each sends one request and waits for its answer, at most the client's time-out.
- * After BVMH_ERROR_TIMED_OUT the client stays usable; a late answer is recognised and dropped. When the helper
- * has left since the last call, a routine checks in again, once, and only while its request has certainly not
- * been carried out; a request that may have been carried out is never sent twice.
- * Out-values are written on BVMH_OK only, except regions, which are made empty first.
+ * After BVMH_ERROR_TIMED_OUT the client stays usable; a late answer is recognised and dropped. When the
+ * helper has left since the last call, a routine checks in again, once, and only while its request has
+ * certainly not been carried out; a request that may have been carried out is never sent twice. Out-values
+ * are written on BVMH_OK only, except regions, which are made empty first.
  */
 
 /* Voicemail. Keys and tokens: at most 255 bytes. A buffer for a token has at least BVMH_TOKEN_SIZE bytes; a
@@ -162,8 +162,8 @@ BVMH_API BVMH_CHECKED int32_t BVMobileHelperIsVoicemailServiceSubscribed(bvmh_cl
 
 /* Preferences of the helper's own account, any host. Domain and key: at most 255 bytes. */
 
-/* Stores a value: a property list, XML or binary, of any size up to 4 GiB. A value of exactly one byte, whatever
- * the byte, removes the key. BVMH_FAILURE: the bytes are no property list; nothing was changed. */
+/* Stores a value: a property list, XML or binary, of any size up to 4 GiB. A value of exactly one byte,
+ * whatever the byte, removes the key. BVMH_FAILURE: the bytes are no property list; nothing was changed. */
 BVMH_API BVMH_CHECKED int32_t BVMobileHelperSetPreferenceValue(bvmh_client* client, const char* domain,
                                                                const char* key, const void* value,
                                                                size_t length);
@@ -173,8 +173,8 @@ BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyPreferenceValue(bvmh_client* cli
 /* The same in application scope, which also looks at this host's and every user's values. */
 BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyAppPreferenceValue(bvmh_client* client, const char* domain,
                                                                    const char* key, bvmh_region* value);
-/* Reads a property-list file whose top level is a dictionary (at most 255 bytes of path) and returns it as XML.
- * BVMH_MEMORY_FAILURE: it cannot be read, or is something else. */
+/* Reads a property-list file whose top level is a dictionary (at most 255 bytes of path) and returns it as
+ * XML. BVMH_MEMORY_FAILURE: it cannot be read, or is something else. */
 BVMH_API BVMH_CHECKED int32_t BVMobileHelperLoadPlistFile(bvmh_client* client, const char* path,
                                                           bvmh_region* plist);
 
@@ -220,7 +220,8 @@ BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyCountryCode(bvmh_client* client,
 /* Labels. Both arguments are serialized property lists, XML or binary, whose top level is an array; the
  * languages are texts such as "de" or "pt-BR". The result is an XML property list, an array of texts. */
 
-/* labels: pairs of a label key ("USER_LABEL_PRIMARY" ...) and an ignored text, or of "" and a label's own text. */
+/* labels: pairs of a label key ("USER_LABEL_PRIMARY" ...) and an ignored text, or of "" and a label's own
+ * text. */
 BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyBadgeLabels(bvmh_client* client, const void* labels,
                                                             size_t labels_length, const void* languages,
                                                             size_t languages_length, bvmh_region* result);
@@ -280,8 +281,8 @@ typedef struct bvmh_event {
   bvmh_region payload; /* a binary property list, a dictionary, as it came: not yet checked */
   uint32_t sender_uid;
   int32_t sender_pid;
-  bool wants_reply;       /* bvmh_listener_reply is awaited; the helper waits at most a second for it */
-  uint64_t connection;    /* the library's, as are the next two */
+  bool wants_reply;    /* bvmh_listener_reply is awaited; the helper waits at most a second for it */
+  uint64_t connection; /* the library's, as are the next two */
   uint32_t reply_port;
   int32_t message_id;
 } bvmh_event;

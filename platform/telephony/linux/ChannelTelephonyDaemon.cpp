@@ -15,10 +15,10 @@
 #include <span>
 #include <utility>
 
+#include "interface/TelephonyMessages.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/plist/PropertyList.h"
 #include "platform/plist/PropertyListCodec.h"
-#include "platform/telephony/TelephonyMessages.h"
 
 namespace brenvik {
 namespace {

@@ -16,9 +16,9 @@
 #include <filesystem>
 #include <thread>
 
+#include "interface/TelephonyMessages.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/plist/PropertyListCodec.h"
-#include "platform/telephony/TelephonyMessages.h"
 
 namespace brenvik {
 namespace {
