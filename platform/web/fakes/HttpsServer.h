@@ -62,6 +62,11 @@ class Identity {
     const OpenSslPointer<std::FILE> file(std::fopen(path.c_str(), "we"));
     check(file != nullptr && PEM_write_X509(file.get(), certificate_.get()) == 1);
   }
+  void writeKey(const std::string& path) const {
+    const OpenSslPointer<std::FILE> file(std::fopen(path.c_str(), "we"));
+    check(file != nullptr &&
+          PEM_write_PrivateKey(file.get(), key_.get(), nullptr, nullptr, 0, nullptr, nullptr) == 1);
+  }
 
  private:
   static void check(bool ok) {
