@@ -65,6 +65,7 @@ int ArchiveFrameParser::takeHead() {
       return EPROTO;
   }
   inFrame_ = length > 0;
+  lastWasLarge_ = left_ >= archive_frame::kLargeChunk;
   return 0;
 }
 
@@ -95,6 +96,13 @@ int ArchiveFrameParser::takeSmallFrame() {
   std::memcpy(&refusal, pending_.data(), sizeof refusal);
   if (head_.type == Type::failed) return plausible(refusal.code);
   return sink_.refuseEntry(pending_.substr(sizeof refusal), plausible(refusal.code));
+}
+
+std::size_t ArchiveFrameParser::bestPiece() const {
+  if (left_ >= archive_frame::kLargeChunk) return left_;
+  // Behind one large chunk there is usually another.
+  return lastWasLarge_ && !inFrame_ ? sizeof(Head) - pending_.size()
+                                    : std::size_t{archive_frame::kLargestChunk};
 }
 
 int ArchiveFrameParser::take(std::string_view bytes) {

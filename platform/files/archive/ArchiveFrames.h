@@ -50,6 +50,7 @@ struct Refusal {
 inline constexpr std::uint64_t kUnknownSize = ~std::uint64_t{0};
 inline constexpr std::int64_t kNoTime = INT64_MIN;
 inline constexpr std::size_t kLongestPath = 1024;
+inline constexpr std::uint32_t kLargeChunk = 64 << 10;       // from here on a chunk is written alone
 inline constexpr std::uint32_t kLargestChunk = 1 << 20;      // of data or companion in one frame
 inline constexpr std::uint32_t kLargestCompanion = 4 << 20;  // as much as the reader hands over
 
@@ -84,6 +85,8 @@ class ArchiveFrameParser {
   // 0: wants more bytes, or has finished. Else the errno value that ended it: EPROTO, what the sink returned,
   // or what the reader reported as its failure. Not to be called again after that.
   int take(std::string_view bytes);
+  // How many bytes the next piece should have at most, so that large chunks come in pieces of their own.
+  std::size_t bestPiece() const;
   // The reader has read the archive to its end; no byte may follow.
   bool hasFinished() const { return finished_; }
 
@@ -100,6 +103,7 @@ class ArchiveFrameParser {
   bool inEntry_ = false;
   archive_frame::Kind kind_ = archive_frame::Kind::file;
   std::uint32_t companionBytes_ = 0;  // of the entry
+  bool lastWasLarge_ = false;
   bool finished_ = false;
 };
 

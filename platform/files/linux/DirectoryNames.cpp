@@ -28,7 +28,7 @@ int DirectoryNames::load(int directory) {
       unsigned char type = entry.d_type;
       struct stat info {};
       if (type == DT_UNKNOWN && ::fstatat(directory, name, &info, AT_SYMLINK_NOFOLLOW) == 0) {
-        type = IFTODT(info.st_mode);
+        type = static_cast<unsigned char>(IFTODT(info.st_mode));
       }
       packed_ += static_cast<char>(type);
       packed_.append(name, std::strlen(name) + 1);

@@ -4,7 +4,6 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
-#include <sys/random.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -18,7 +17,7 @@
 namespace brenvik {
 namespace {
 
-constexpr int kAttempts = 8;
+constexpr int kAttempts = 4;
 
 std::string stageName(std::uint64_t number) {
   char text[32];
@@ -75,10 +74,9 @@ Stage::~Stage() {
   }
 }
 
-void Stage::useOtherName() {
-  std::uint64_t number = 0;
-  if (::getrandom(&number, sizeof number, GRND_NONBLOCK) < 0) number = hashOf(name_);
-  name_ = stageName(number);
+// Four names for one place: one that a living process works under leaves three.
+void Stage::useName(int attempt) {
+  name_ = stageName(hashOf(place_.name) + static_cast<std::uint64_t>(attempt));
 }
 
 // Removes what stands under the stage's name, unless a living process works in it. 0 or errno, EBUSY for the
@@ -92,10 +90,15 @@ int Stage::clearStale() {
 
 int Stage::makeDirectory() {
   const int directory = place_.directory.get();
+  // Whichever name a killed process has used, nothing of it stays.
   for (int attempt = 0; attempt < kAttempts; ++attempt) {
+    useName(attempt);
+    if (::faccessat(directory, name_.c_str(), F_OK, AT_SYMLINK_NOFOLLOW) == 0) (void)clearStale();
+  }
+  for (int attempt = 0; attempt < kAttempts; ++attempt) {
+    useName(attempt);
     if (::mkdirat(directory, name_.c_str(), 0700) != 0) {
       if (errno != EEXIST) return errno;
-      if (clearStale() != 0) useOtherName();
       continue;
     }
     named_ = true;
@@ -112,7 +115,6 @@ int Stage::makeDirectory() {
       return (made.st_mode & 07777) == 0700 || ::fchmod(fd_.get(), 0700) == 0 ? 0 : errno;
     }
     named_ = false;
-    useOtherName();
   }
   return EBUSY;
 }
@@ -126,26 +128,29 @@ int Stage::makeFile() {
   }
   if (errno != EOPNOTSUPP && errno != EISDIR && errno != EINVAL && errno != ENOENT) return errno;
   for (int attempt = 0; attempt < kAttempts; ++attempt) {
+    useName(attempt);
+    if (::faccessat(directory, name_.c_str(), F_OK, AT_SYMLINK_NOFOLLOW) == 0) (void)clearStale();
     fd_.reset(::openat(directory, name_.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
-    if (fd_.isValid()) {
-      named_ = true;
-      dropInheritedAccess(fd_.get());
-      // Held until the end: tells another process that this one is alive.
-      return ::flock(fd_.get(), LOCK_EX | LOCK_NB) == 0 ? 0 : errno;
+    if (!fd_.isValid()) {
+      if (errno != EEXIST) return errno;
+      continue;
     }
-    if (errno != EEXIST) return errno;
-    if (clearStale() != 0) useOtherName();
+    named_ = true;
+    dropInheritedAccess(fd_.get());
+    // Held until the end: tells another process that this one is alive.
+    return ::flock(fd_.get(), LOCK_EX | LOCK_NB) == 0 ? 0 : errno;
   }
   return EBUSY;
 }
 
 int Stage::reserveName() {
   for (int attempt = 0; attempt < kAttempts; ++attempt) {
+    useName(attempt);
     struct stat info {};
     if (::fstatat(place_.directory.get(), name_.c_str(), &info, AT_SYMLINK_NOFOLLOW) != 0) {
       return errno == ENOENT ? 0 : errno;
     }
-    if (clearStale() != 0) useOtherName();
+    if (clearStale() == 0) return 0;
   }
   return EBUSY;
 }

@@ -45,8 +45,8 @@ class Stage {
   int publish(IfPresent ifPresent);
 
  private:
+  void useName(int attempt);
   int clearStale();
-  void useOtherName();
 
   const Place& place_;
   std::string name_;

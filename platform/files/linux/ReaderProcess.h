@@ -25,10 +25,11 @@ class ReaderProcess {
   // process but that and its output. 0 or errno.
   int start(const std::string& program, int input);
 
-  // Hands what the program writes to `take` until that returns another value than 0, the program closes its
-  // output (then EPIPE, unless isComplete() says that nothing is missing) or the time is over (ETIMEDOUT).
+  // Hands what the program writes, at most `wanted` bytes at a time, to `take` until that returns another
+  // value than 0, the program closes its output (then EPIPE, unless isComplete() says that nothing is
+  // missing) or the time is over (ETIMEDOUT).
   int drain(std::chrono::steady_clock::time_point deadline, const std::function<int(std::string_view)>& take,
-            const std::function<bool()>& isComplete);
+            const std::function<std::size_t()>& wanted, const std::function<bool()>& isComplete);
 
  private:
   pid_t pid_ = -1;

@@ -98,7 +98,7 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
     if (const int error = reader.start(reader_, input.get()); error != 0) return error;
     const int error = reader.drain(
         deadline, [&](std::string_view bytes) { return parser.take(bytes); },
-        [&] { return parser.hasFinished(); });
+        [&] { return parser.bestPiece(); }, [&] { return parser.hasFinished(); });
     *wasAnswered = writer.wasStoppedByAnswer();
     if (error != 0) return error;
   }
