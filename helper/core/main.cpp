@@ -17,12 +17,14 @@
 #include "helper/core/EntryPoint.h"
 #include "helper/core/HelperRoutines.h"
 #include "helper/entitlement/EntitlementCheck.h"
+#include "helper/location/GeoRequestState.h"
 #include "helper/mobile/MobileUser.h"
 #include "helper/requests/RequestTable.h"
 #include "platform/accounts/linux/PasswordDatabase.h"
 #include "platform/baseband/linux/LoadedBasebandLibrary.h"
 #include "platform/contacts/linux/SqliteContacts.h"
 #include "platform/files/linux/LinuxFileManager.h"
+#include "platform/geo/linux/SystemGeoService.h"
 #include "platform/ipc/linux/SystemBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/labeler/linux/CatalogueLabeler.h"
@@ -33,6 +35,7 @@
 #include "platform/radio/linux/ModemManagerLogs.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/security/linux/EntitlementFiles.h"
+#include "platform/telephony/linux/ChannelTelephonyDaemon.h"
 #include "platform/web/linux/LoadedWebModule.h"
 
 namespace brenvik {
@@ -87,8 +90,8 @@ int run() {
     return MobileAccount{mobile.homeDirectory(), mobile.uid(), mobile.gid()};
   };
   PathPolicy policy(mobileAccount);
-  CarrierOperations carrier(FileSystemManager::factory(files), [] { return nullptr; }, policy, preferences,
-                            mobileAccount);
+  CarrierOperations carrier(
+      FileSystemManager::factory(files), [] { return nullptr; }, policy, preferences, mobileAccount);
   ModemManagerLogs radio(queues);
   RadioLogging radioLogging(radio);
 
@@ -98,6 +101,14 @@ int run() {
   ChannelRemap channelRemap(contacts);
 
   LoadedWebModule web(queues);
+  ChannelTelephonyDaemon telephonyDaemon(BRENVIK_BOOTSTRAP_DIRECTORY);
+  SystemGeoService geoService(queues, web.webClient(),
+                              {.geocoderUrl = BRENVIK_GEOCODER_URL,
+                               .gazetteer = BRENVIK_GAZETTEER,
+                               .stunServer = BRENVIK_STUN_SERVER,
+                               .countryFiles = {.configuration = BRENVIK_COUNTRY_CONFIGURATION}});
+  LocationRoutines location(queues, geoService, telephonyDaemon, GeoRequestState::shared());
+
   ChannelMessagePorts messagePorts(BRENVIK_BOOTSTRAP_DIRECTORY);
   const auto& lasd = LASDUpdater::shared();
   lasd->configure({.queues = queues,
@@ -114,6 +125,7 @@ int run() {
                            .radioLogging = radioLogging,
                            .labels = labels,
                            .channelRemap = channelRemap,
+                           .location = location,
                            .lasd = *lasd,
                            .heartbeat = heartbeat});
   const RequestTable requests(routines);
