@@ -595,6 +595,7 @@ class GeocoderTest(LocationTest):
         self.assertEqual(len(brenvik.pushes), 1)
 
     def test_a_late_answer_serves_the_next_request(self):
+        brenvik = Brenvik(self)
         release = threading.Event()
         self.addCleanup(release.set)
 
@@ -604,11 +605,10 @@ class GeocoderTest(LocationTest):
                 MapServer.send(handler, 200, json.dumps(PARIS))
             else:
                 release.set()
-                time.sleep(20 if not self.daemon.running() else 0.5)
+                eventually(lambda: len(brenvik.pushes) == 2, 20)
                 MapServer.send(handler, 200, '{"address":{"city":"Oslo","country_code":"no"}}')
 
         self.map.answer = late
-        brenvik = Brenvik(self)
         client = self.client()
         self.ask_civic(client, 48.8584, 2.2945)
         brenvik.wait_for(1)  # the first one's time-out
