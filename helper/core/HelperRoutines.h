@@ -28,6 +28,7 @@ class HelperRoutines final : public ServerRoutines {
     RadioLogging& radioLogging;
     LabelRoutines& labels;
     ChannelRemap& channelRemap;
+    LocationRoutines& location;
     LASDUpdater& lasd;
     CellularHeartbeat& heartbeat;
     PortServerRegistry& registry = PortServerRegistry::shared();
@@ -95,8 +96,9 @@ class HelperRoutines final : public ServerRoutines {
   KernelReturn server_BVMobileHelperRemoveCarrierFile(PortName port, char* path, char* domain) override {
     return areas_.carrier.removeCarrierFile(port, path, domain);
   }
-  KernelReturn server_BVMobileHelperCopyCarrierFile(PortName port, char* sourceDirectory, char* destinationDirectory,
-                                                    char* fileName, std::uint8_t* success) override {
+  KernelReturn server_BVMobileHelperCopyCarrierFile(PortName port, char* sourceDirectory,
+                                                    char* destinationDirectory, char* fileName,
+                                                    std::uint8_t* success) override {
     return areas_.carrier.copyCarrierFile(port, sourceDirectory, destinationDirectory, fileName, success);
   }
   KernelReturn server_BVMobileHelperCopyCrashLogs(PortName port, char* path, std::uint8_t* success) override {
@@ -115,8 +117,9 @@ class HelperRoutines final : public ServerRoutines {
                                                     OutOfLinePayload* badges) override {
     return areas_.labels.CopyBadgeLabels(labels, labelsLength, languages, languagesLength, badges);
   }
-  KernelReturn server_BVMobileHelperCopyLocalizedLabels(PortName, const void* labels, std::uint32_t labelsLength,
-                                                        const void* languages, std::uint32_t languagesLength,
+  KernelReturn server_BVMobileHelperCopyLocalizedLabels(PortName, const void* labels,
+                                                        std::uint32_t labelsLength, const void* languages,
+                                                        std::uint32_t languagesLength,
                                                         OutOfLinePayload* texts) override {
     return areas_.labels.CopyLocalizedLabels(labels, labelsLength, languages, languagesLength, texts);
   }
@@ -135,6 +138,16 @@ class HelperRoutines final : public ServerRoutines {
     if (server == nullptr) return kern::failure;
     areas_.lasd.checkForUpdate(*server, static_cast<std::uint32_t>(mask));
     return kern::success;
+  }
+  KernelReturn server_BVMobileHelperRequestCountryCodeFromLocation(PortName port, double latitude,
+                                                                   double longitude) override {
+    return areas_.location.server_BVMobileHelperRequestCountryCodeFromLocation(port, latitude, longitude);
+  }
+  KernelReturn server_BVMobileHelperCopyCountryCode(PortName port, char* countryCode) override {
+    return areas_.location.server_BVMobileHelperCopyCountryCode(port, countryCode);
+  }
+  KernelReturn server_BVMobileHelperRequestWanIPFromLocation(PortName port) override {
+    return areas_.location.server_BVMobileHelperRequestWanIPFromLocation(port);
   }
 
  private:
