@@ -2,15 +2,17 @@
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 """bvhelperctl, and through it the C library, against the real daemon."""
 import datetime
+import errno
 import json
 import pathlib
 import plistlib
 import shutil
 import subprocess
 import tempfile
+import zipfile
 
 import wire
-from harness import ALLOW, BUILD, ENTITLEMENTS, LOG_ERR, Daemon, HelperTest, entitle, eventually, main
+from harness import ALLOW, BUILD, ENTITLEMENTS, LOG_ERR, LOG_NOTICE, Daemon, HelperTest, entitle, eventually, main
 
 # Where every account may run it, which the build folder need not be.
 TOOL = pathlib.Path("/run/bin/bvhelperctl")
@@ -121,6 +123,10 @@ class Files(ToolTest):
 
 
 class Switches(ToolTest):
+    def test_heartbeat(self):
+        self.expect("cellular heartbeat on\n", "heartbeat", "on")
+        self.expect("cellular heartbeat off\n", "heartbeat", "off")
+
     def test_radio_logs(self):
         self.expect("radio manager logs on\n", "radio-logs", "on")
         self.logs.wait_for("bsd", LOG_ERR, "Enabling wireless radio manager logs: 1")
@@ -163,6 +169,20 @@ class Carrier(ToolTest):
         self.expect(f"bvhelperctl: refused: {other} is no carrier file: not listed, not in the carrier bundles, no "
                     "package in /tmp\n", "carrier", "remove", str(other), status=1)
 
+    def test_archives_and_crash_logs(self):
+        archive = self.folder / "a.zip"
+        with zipfile.ZipFile(archive, "w") as writer:
+            writer.writestr("folder/file", "content")
+        target = self.folder / "unpacked"
+        target.mkdir()
+        self.expect(f"unpacked {archive} into {target}\n", "carrier", "unpack", str(archive), str(target))
+        self.assertEqual((target / "folder" / "file").read_text(), "content")
+        archive.write_bytes(b"no archive")
+        self.expect(f"bvhelperctl: did not unpack {archive} into {target}; the helper's log tells why\n", "carrier",
+                    "unpack", str(archive), str(target), status=1)
+        (self.HOME / "Library" / "Logs").mkdir()
+        self.expect(f"copied {target} to the crash logs\n", "carrier", "copy-crash-logs", str(target))
+
     def test_bundles(self):
         bundles = self.HOME / "Library" / "Carrier Bundles"
         (self.folder / "New.bundle").mkdir()
@@ -176,21 +196,87 @@ class Carrier(ToolTest):
                     "why\n", "carrier", "copy-file", str(self.folder), "/var/tmp", "carrier.plist", status=1)
 
 
+class Voicemail(ToolTest):
+    def test_tokens(self):
+        self.expect("(no token)\n", "voicemail", "token")
+        self.expect("set the voicemail token\n", "voicemail", "set-token", "general")
+        self.expect("set the voicemail token for K\n", "voicemail", "set-token", "--key", "K", "special")
+        self.expect("general\n", "voicemail", "token")
+        self.expect("special\n", "voicemail", "token", "--key", "K")
+        self.expect("cleared the voicemail token\n", "voicemail", "clear")
+        self.expect("(no token)\n", "voicemail", "token")
+        self.expect("special\n", "voicemail", "token", "--key", "K")
+        self.expect("cleared the voicemail token and removed every record\n", "voicemail", "reset")
+        self.expect("(no token)\n", "voicemail", "token", "--key", "K")
+        self.expect("not subscribed\n", "voicemail", "subscribed")
+
+
 class Events(ToolTest):
+    """Answers that come later, to whoever stands in for the telephony daemon."""
+
+    COUNTRY = pathlib.Path("/var/lib/brenvik/country.plist")
+
+    def prepare(self):
+        super().prepare()
+        self.COUNTRY.parent.mkdir(parents=True, exist_ok=True)
+        self.COUNTRY.write_bytes(plistlib.dumps({"CountryCode": "DE"}))
+        self.addCleanup(self.COUNTRY.unlink)
+
+    def listen(self, *command):
+        program = subprocess.Popen([str(each) for each in command] + ["--json", "--count", "1"],
+                                   stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
+        self.addCleanup(program.stderr.close)
+        self.addCleanup(program.stdout.close)
+        self.addCleanup(program.wait)
+        self.addCleanup(program.kill)
+        self.assertIn("listening in", program.stderr.readline())
+        return program
+
+    def event(self, program):
+        event = json.loads(program.stdout.readline())
+        self.assertEqual(event["sender"], {"uid": 0, "pid": self.daemon.pid})
+        self.assertEqual(program.wait(10), 0)
+        return event
+
     def test_watch_shows_the_outcome_of_an_update_check(self):
-        watch = subprocess.Popen([TOOL, "--json", "watch", "--count", "1"], stdout=subprocess.PIPE,
-                                 stderr=subprocess.PIPE, text=True)
-        self.addCleanup(watch.wait)
-        self.addCleanup(watch.kill)
-        with watch.stdout, watch.stderr:
-            self.assertIn("listening in", watch.stderr.readline())
-            self.assertEqual(self.json("lasd", "check", "--type", "gsm")["mask"], 8)
-            event = json.loads(watch.stdout.readline())
-        # There is no update server in the sandbox.
+        watch = self.listen(TOOL, "watch")
+        self.assertEqual(self.json("lasd", "check", "--type", "gsm")["mask"], 8)
+        event = self.event(watch)  # there is no update server in the sandbox
         self.assertEqual((event["event"], event["values"]),
                          ("notification", {"Notification": "com.norvale.lasd.UpdateFailed"}))
-        self.assertEqual(event["sender"], {"uid": 0, "pid": self.daemon.pid})
-        self.assertEqual(watch.wait(10), 0)
+
+    def test_a_civic_address_is_pushed_and_taken(self):
+        standin = self.listen(BUILD / "brenvik-standin")
+        self.expect("asked; the answer goes to the telephony daemon (see \"watch\")\n", "location", "civic", "0", "0")
+        event = self.event(standin)
+        self.assertEqual((event["event"], event["answer"]), ("civic-info", "success"))
+        self.assertEqual((event["values"]["Client"], event["values"]["CountryCode"]), (["BrenvikMobileHelper"], "DE"))
+        self.logs.wait_for("bsd", LOG_NOTICE, "sendCivicInfoToQV sent civic info to Brenvik successfully")
+        self.expect("DE\n", "location", "country")
+
+    def test_a_refused_push_is_logged_by_the_daemon(self):
+        standin = self.listen(BUILD / "brenvik-standin", "--refuse", "13")
+        self.assertEqual(run("location", "civic", "0", "0").returncode, 0)
+        self.assertEqual(self.event(standin)["answer"], "refused with 13")
+        self.logs.wait_for("bsd", LOG_NOTICE, "sendCivicInfoToQV failed civic info to Brenvik due to error: 13")
+
+    def test_a_stand_in_that_hangs_costs_the_daemon_a_second(self):
+        standin = subprocess.Popen([BUILD / "brenvik-standin", "--hang"], stdout=subprocess.PIPE,
+                                   stderr=subprocess.PIPE, text=True)
+        with standin.stdout, standin.stderr:
+            standin.stderr.readline()
+            self.assertEqual(run("location", "civic", "0", "0").returncode, 0)
+            self.assertIn("(answer: none)", standin.stdout.readline())
+            self.logs.wait_for("bsd", LOG_NOTICE,
+                               f"sendCivicInfoToQV failed civic info to Brenvik due to error: {errno.ETIMEDOUT}")
+            standin.terminate()
+            self.assertEqual(standin.wait(10), 0)
+
+    def test_a_public_address_that_cannot_be_had_is_pushed_as_empty(self):
+        watch = self.listen(TOOL, "watch")
+        self.assertEqual(run("location", "wan-ip").returncode, 0)
+        event = self.event(watch)
+        self.assertEqual((event["event"], event["values"]["Address"]), ("local-address", ""))
 
 
 class Life(ToolTest):
