@@ -38,9 +38,12 @@ bool failsNow() {
 }  // namespace
 
 extern "C" {
+// The names under which the C library keeps its own functions reachable.
+// NOLINTBEGIN(bugprone-reserved-identifier)
 void* __libc_malloc(std::size_t size);
 void* __libc_calloc(std::size_t count, std::size_t size);
 void* __libc_realloc(void* memory, std::size_t size);
+// NOLINTEND(bugprone-reserved-identifier)
 void* malloc(std::size_t size) { return failsNow() ? nullptr : __libc_malloc(size); }
 void* calloc(std::size_t count, std::size_t size) {
   return failsNow() ? nullptr : __libc_calloc(count, size);

@@ -50,18 +50,30 @@ bool allPlain(std::uint64_t word) noexcept {
   const std::uint64_t control = (word - kOnes * 0x20) & ~word;
   const std::uint64_t angle = zeroIn((word | kOnes * 2) ^ kOnes * '>');
   const std::uint64_t amp = zeroIn(word ^ kOnes * '&');
-  return ((control | angle | amp | word) & kTops) == 0;
+  const std::uint64_t lookAheads = zeroIn(word ^ kOnes * 0xEF);
+  return ((control | angle | amp | lookAheads) & kTops) == 0;
+}
+
+std::uint64_t load64(const char* bytes) noexcept {
+  std::uint64_t word;
+  std::memcpy(&word, bytes, sizeof word);
+  return word;
 }
 
 constexpr char kBase64[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
 
+// The two characters for each twelve bits.
+constexpr std::array<std::array<char, 2>, 4096> kBase64Pairs = [] {
+  std::array<std::array<char, 2>, 4096> pairs{};
+  for (std::size_t i = 0; i < pairs.size(); ++i) pairs[i] = {kBase64[i >> 6], kBase64[i & 63]};
+  return pairs;
+}();
+
 char* encodeLine(const unsigned char* bytes, std::size_t size, char* to) noexcept {
   for (; size >= 3; size -= 3, bytes += 3) {
     const std::uint32_t group = std::uint32_t{bytes[0]} << 16 | std::uint32_t{bytes[1]} << 8 | bytes[2];
-    to[0] = kBase64[group >> 18];
-    to[1] = kBase64[group >> 12 & 63];
-    to[2] = kBase64[group >> 6 & 63];
-    to[3] = kBase64[group & 63];
+    std::memcpy(to, kBase64Pairs[group >> 12].data(), 2);
+    std::memcpy(to + 2, kBase64Pairs[group & 0xFFF].data(), 2);
     to += 4;
   }
   if (size == 0) return to;
@@ -137,7 +149,12 @@ class Writer {
     cursor_ += size - 1;
   }
   void indent() {
-    std::memset(cursor_, '\t', depth_);
+    // Nearly always so few that a call would cost more.
+    if (depth_ <= 8) {
+      std::memcpy(cursor_, "\t\t\t\t\t\t\t\t", 8);
+    } else {
+      std::memset(cursor_, '\t', depth_);
+    }
     cursor_ += depth_;
   }
   void text(const Node& node);
@@ -181,15 +198,23 @@ void Writer::text(const Node& node) {
   while (from != end && !failed_) {
     const char* const pieceEnd = static_cast<std::size_t>(end - from) > kPiece ? from + kPiece : end;
     reserve(kPiece * kLongestReference + 8);
+    const char* const pieceBegin = from;
     char* to = cursor_;
     while (from < pieceEnd) {
       while (pieceEnd - from >= 8) {
-        std::uint64_t word;
-        std::memcpy(&word, from, sizeof word);
+        const std::uint64_t word = load64(from);
         if (!allPlain(word)) break;
         std::memcpy(to, &word, sizeof word);
         from += 8;
         to += 8;
+      }
+      // The last few bytes go together with some before them, which, being plain, stand before `to` already.
+      if (const auto left = pieceEnd - from; left < 8 && pieceEnd - pieceBegin >= 8) {
+        if (const std::uint64_t word = load64(pieceEnd - 8); allPlain(word)) {
+          std::memcpy(to + left - 8, &word, sizeof word);
+          to += left;
+          from = pieceEnd;
+        }
       }
       for (int i = 0; i < 8 && from < pieceEnd; ++i, ++from) {
         const std::uint8_t kind = kByteClasses[static_cast<unsigned char>(*from)];
