@@ -59,6 +59,8 @@ endif()
 # ccache, where there is one, makes the sanitizer builds of a second run cheap.
 find_program(BRENVIK_CCACHE ccache)
 if(BRENVIK_CCACHE AND NOT CMAKE_CXX_COMPILER_LAUNCHER)
-  set(CMAKE_C_COMPILER_LAUNCHER ${BRENVIK_CCACHE})
-  set(CMAKE_CXX_COMPILER_LAUNCHER ${BRENVIK_CCACHE})
+  # Paths are taken relative to the tree, so that a fresh clone finds what another has built.
+  set(launcher ${CMAKE_COMMAND} -E env CCACHE_BASEDIR=${PROJECT_SOURCE_DIR} CCACHE_NOHASHDIR=1 ${BRENVIK_CCACHE})
+  set(CMAKE_C_COMPILER_LAUNCHER ${launcher})
+  set(CMAKE_CXX_COMPILER_LAUNCHER ${launcher})
 endif()

@@ -28,7 +28,6 @@ class HelperRoutines final : public ServerRoutines {
     RadioLogging& radioLogging;
     LabelRoutines& labels;
     ChannelRemap& channelRemap;
-    LocationRoutines& location;
     LASDUpdater& lasd;
     CellularHeartbeat& heartbeat;
     PortServerRegistry& registry = PortServerRegistry::shared();
@@ -138,16 +137,6 @@ class HelperRoutines final : public ServerRoutines {
     if (server == nullptr) return kern::failure;
     areas_.lasd.checkForUpdate(*server, static_cast<std::uint32_t>(mask));
     return kern::success;
-  }
-  KernelReturn server_BVMobileHelperRequestCountryCodeFromLocation(PortName port, double latitude,
-                                                                   double longitude) override {
-    return areas_.location.server_BVMobileHelperRequestCountryCodeFromLocation(port, latitude, longitude);
-  }
-  KernelReturn server_BVMobileHelperCopyCountryCode(PortName port, char* countryCode) override {
-    return areas_.location.server_BVMobileHelperCopyCountryCode(port, countryCode);
-  }
-  KernelReturn server_BVMobileHelperRequestWanIPFromLocation(PortName port) override {
-    return areas_.location.server_BVMobileHelperRequestWanIPFromLocation(port);
   }
 
  private:
