@@ -102,8 +102,8 @@ void CountryConfiguration::refreshConfiguration() {
   const auto content = readFile(files_.configuration, &status);
   if (content) {
     identity_ = identityOf(status);
-    const auto code = parsePropertyList(std::as_bytes(std::span(*content))).find("CountryCode").asString();
-    if (code && !code->empty()) configured_ = *code;
+    const PropertyList value = parsePropertyList(std::as_bytes(std::span(*content))).find("CountryCode");
+    if (const auto code = value.asString(); code && !code->empty()) configured_ = *code;
   }
   if (!configured_)
     logUnified(LogLevel::error, "geo service: the country configuration names no country code");

@@ -58,6 +58,11 @@ class SystemGeoService::IpTicket final : public GeoIpTicket {
     if (!ofThisDevice_) return deliver({{}, GeoError{"only this device's own address can be looked up"}});
     const std::lock_guard lock(service_.mutex_);
     if (service_.addressQueue_ == nullptr) {
+      service_.addressFinder_ = std::make_shared<PublicAddressFinder>(
+          [server = service_.stunServer_](int stopFd) {
+            return std::make_unique<UdpStunNetwork>(server, stopFd);
+          },
+          service_.queues_.main());
       service_.addressQueue_ =
           service_.queues_.makeSerial("geo service: address", QualityOfService::standard);
     }
@@ -76,19 +81,15 @@ SystemGeoService::SystemGeoService(WorkQueues& queues, WebClient& webClient, Set
           std::move(settings.geocoderUrl), std::move(settings.gazetteer), webClient,
           [] { return std::chrono::nanoseconds(std::chrono::steady_clock::now().time_since_epoch()); },
           [country = country_](const std::string& code) { country->setLastGeocoded(code); })),
-      addressFinder_(std::make_shared<PublicAddressFinder>(
-          [server = std::move(settings.stunServer)](int stopFd) {
-            return std::make_unique<UdpStunNetwork>(server, stopFd);
-          },
-          queues.main())) {}
+      stunServer_(std::move(settings.stunServer)) {}
 
 SystemGeoService::~SystemGeoService() {
-  addressFinder_->stop();
   geocoder_->close();
   std::shared_ptr<WorkQueue> places;
   std::shared_ptr<WorkQueue> addresses;
   {
     const std::lock_guard lock(mutex_);
+    if (addressFinder_ != nullptr) addressFinder_->stop();
     places.swap(placesQueue_);
     addresses.swap(addressQueue_);
   }

@@ -52,10 +52,11 @@ class SystemGeoService final : public GeoService {
   WorkQueues& queues_;
   const std::shared_ptr<CountryConfiguration> country_;
   const std::shared_ptr<ReverseGeocoder> geocoder_;
-  const std::shared_ptr<PublicAddressFinder> addressFinder_;
+  const std::string stunServer_;
   std::mutex mutex_;
-  std::shared_ptr<WorkQueue> placesQueue_;   // under mutex_
-  std::shared_ptr<WorkQueue> addressQueue_;  // under mutex_
+  std::shared_ptr<WorkQueue> placesQueue_;              // under mutex_
+  std::shared_ptr<WorkQueue> addressQueue_;             // under mutex_
+  std::shared_ptr<PublicAddressFinder> addressFinder_;  // under mutex_, made with its queue
 };
 
 }  // namespace brenvik
