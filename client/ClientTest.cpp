@@ -51,15 +51,6 @@ std::string asText(const bvmh_region& region) {
   return {static_cast<const char*>(region.bytes), region.size};
 }
 
-UniqueFd connectTo(const std::string& path) {
-  UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::memcpy(address.sun_path, path.data(), path.size());
-  EXPECT_EQ(::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-  return socket;
-}
-
 // ---- check-in ------------------------------------------------------------------------------------------
 
 TEST(ClientTest, ChecksInWithADeathWatchPortMovedToTheHelper) {

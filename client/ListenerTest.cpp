@@ -35,15 +35,6 @@ ListenerPointer listenIn(const std::string& directory, unsigned services = BVMH_
   return ListenerPointer(listener);
 }
 
-UniqueFd connectTo(const std::string& path) {
-  UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::memcpy(address.sun_path, path.data(), path.size());
-  EXPECT_EQ(::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-  return socket;
-}
-
 constexpr const char* kPushes = "/com.norvale.brenvik";
 constexpr const char* kNotifications = "/com.norvale.Brenvik.lasd";
 

@@ -20,7 +20,7 @@ namespace {
 char mappingMark;
 
 // From this size on, giving the whole receive buffer away is cheaper than copying the bytes out of it.
-constexpr std::size_t kWorthTheBuffer = 16 * 1024;
+constexpr std::size_t kWorthTheBuffer = 16'384;
 
 constexpr int kSeals = F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE;
 

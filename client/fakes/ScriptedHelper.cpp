@@ -235,6 +235,14 @@ TemporaryDirectory::~TemporaryDirectory() {
   std::filesystem::remove_all(path_, ignored);
 }
 
+UniqueFd connectTo(const std::string& path) {
+  UniqueFd socket = checked(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0), "socket");
+  const sockaddr_un address = addressOf(path);
+  if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
+    fail("connect");
+  return socket;
+}
+
 std::size_t openDescriptors() {
   std::size_t count = 0;
   for ([[maybe_unused]] const auto& each : std::filesystem::directory_iterator("/proc/self/fd")) ++count;

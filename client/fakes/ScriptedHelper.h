@@ -120,6 +120,9 @@ class TemporaryDirectory {
   std::string path_;
 };
 
+// A connection to a socket of type SOCK_SEQPACKET; throws when nobody listens.
+UniqueFd connectTo(const std::string& path);
+
 std::size_t openDescriptors();
 
 }  // namespace brenvik::client
