@@ -53,12 +53,22 @@ bool isPassing(int error) noexcept {
   return error == EMFILE || error == ENFILE || error == ENOMEM || error == EINTR || error == EAGAIN;
 }
 
-// A reader that gives up for lack of memory says the same as for a malformed document. A good file is not to
-// be moved aside for that, so: is there room for a tree of this document?
+// Whether there is room for a tree of a document of this size.
 bool hasMemoryFor(std::size_t documentSize) noexcept {
   void* volatile probe = std::malloc(documentSize * 16 + (std::size_t{1} << 20));  // volatile: do not skip it
   std::free(probe);
   return probe != nullptr;
+}
+
+// What is wrong with a domain's file, or null and its content.
+const char* parse(std::string_view bytes, DomainImage& image) {
+  const PropertyList document = parsePropertyList(std::as_bytes(std::span(bytes)));
+  if (!document) return "not a property list";
+  if (!document.is(PropertyList::Type::dictionary)) return "not a dictionary";
+  auto found = DomainImage::of(document);
+  if (!found) return "too large when taken apart";
+  image = std::move(*found);
+  return nullptr;
 }
 
 UniqueFd openFolderAt(int parent, const char* name) noexcept {
@@ -184,12 +194,12 @@ DomainFile::Attempt DomainFile::tryLoad() const {
     if (::fstat(loaded.pin.get(), &facts) != 0) return passing(errno);
     if (stampOf(facts) == loaded.stamp || round == kReadAttempts) break;
   }
-  const PropertyList document = parsePropertyList(std::as_bytes(std::span(bytes)));
-  if (!document) return hasMemoryFor(bytes.size()) ? damaged("not a property list") : passing(ENOMEM);
-  if (!document.is(PropertyList::Type::dictionary)) return damaged("not a dictionary");
-  auto image = DomainImage::of(document);
-  if (!image) return hasMemoryFor(bytes.size()) ? damaged("too large when taken apart") : passing(ENOMEM);
-  loaded.image = std::move(*image);
+  const char* damage = parse(bytes, loaded.image);
+  // The codec says the same of a malformed document and of a lack of memory. A good file is not to be moved
+  // aside for the latter: there must be room, and a second look must give the same.
+  if (damage != nullptr && !hasMemoryFor(bytes.size())) return passing(ENOMEM);
+  if (damage != nullptr) damage = parse(bytes, loaded.image);
+  if (damage != nullptr) return damaged(damage);
   loaded.state = State::read;
   timespec now{};
   ::clock_gettime(CLOCK_REALTIME, &now);

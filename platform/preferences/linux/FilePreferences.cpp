@@ -65,12 +65,7 @@ class FilePreferences::Domain {
 
   void setValue(std::string_view key, const PropertyList& value) {
     const std::lock_guard lock(mutex_);
-    try {
-      pending_.insert_or_assign(std::string(key), value);
-    } catch (const std::bad_alloc&) {
-      isIncomplete_ = true;
-      throw;
-    }
+    pending_.insert_or_assign(std::string(key), value);
   }
 
   PropertyList copyValue(std::string_view key) {
@@ -82,10 +77,9 @@ class FilePreferences::Domain {
 
   bool synchronize() {
     const std::lock_guard lock(mutex_);
-    const bool isComplete = !std::exchange(isIncomplete_, false);
     if (pending_.empty()) {
       if (!isCurrent()) load(nullptr);
-      return isComplete;
+      return true;
     }
     // Also when memory runs out on the way: what was not stored is dropped, and the file is read anew.
     struct Drop {
@@ -97,7 +91,7 @@ class FilePreferences::Domain {
       }
     } drop{*this};
     drop.isStored = store();
-    return drop.isStored && isComplete;
+    return drop.isStored;
   }
 
   void forget() noexcept {
@@ -172,8 +166,7 @@ class FilePreferences::Domain {
 
   std::mutex mutex_;                                          // of what follows
   std::map<std::string, PropertyList, std::less<>> pending_;  // no value: to be removed
-  bool isIncomplete_ = false;  // there was no memory to keep something that was set
-  DomainImage image_;          // of the file
+  DomainImage image_;                                         // of the file
   FileStamp stamp_;
   UniqueFd pin_;
   bool isLoaded_ = false;
@@ -244,14 +237,16 @@ void FilePreferences::setValue(std::string_view key, const PropertyList& value, 
     logUnified(LogLevel::error, "Preferences: domain \"%.*s\" names no file, nothing is stored",
                static_cast<int>(domain.size()), domain.data());
   } catch (const std::bad_alloc&) {
+    hasLostValue_ = true;
     logUnified(LogLevel::error, "Preferences: no memory to set a value");
   }
 }
 
 bool FilePreferences::synchronize(std::string_view domain, UserScope user, HostScope host) noexcept {
+  const bool isWhole = !hasLostValue_.exchange(false);
   try {
     const auto found = find(domain, user, host);
-    return found != nullptr && found->synchronize();
+    return found != nullptr && found->synchronize() && isWhole;
   } catch (const std::bad_alloc&) {
     logUnified(LogLevel::error, "Preferences: no memory to store a domain");
     return false;
@@ -269,7 +264,7 @@ PropertyList FilePreferences::copyValue(std::string_view key, std::string_view d
 }
 
 bool FilePreferences::synchronizeApplication(std::string_view domain) noexcept {
-  bool isWhole = namesPreferencesFile(domain);
+  bool isWhole = !hasLostValue_.exchange(false) && namesPreferencesFile(domain);
   try {
     for (const auto [user, host] : kApplicationScopes) {
       if (const auto found = find(domain, user, host)) isWhole = found->synchronize() && isWhole;

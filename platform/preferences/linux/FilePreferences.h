@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <functional>
 #include <list>
@@ -66,6 +67,8 @@ class FilePreferences final : public PreferencesStore {
 
   const std::function<Places()> askForPlaces_;
   const std::chrono::milliseconds patience_;
+  // There was no memory to keep a value that was set; whichever synchronize() comes next says so.
+  std::atomic<bool> hasLostValue_ = false;
   std::mutex mutex_;  // of what follows; never held while a domain works
   std::optional<Places> places_;
   std::list<std::shared_ptr<Domain>> domains_;  // last used first

@@ -29,7 +29,8 @@ constexpr auto kHost = HostScope::anyHost;
 constexpr const char kDomain[] = "com.example.crash";
 constexpr std::uint32_t kKeys = 5;
 
-// To fork takes a sanitizer's program some 50 ms, and it has nothing more to find out about what a kill leaves.
+// To fork takes a sanitizer's program some 50 ms, and it has nothing more to find out about what a kill
+// leaves.
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 constexpr int kKills = 100;
 #else

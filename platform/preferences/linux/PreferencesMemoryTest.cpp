@@ -1,0 +1,149 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+//
+// Every allocation of a set and of a read fails once, alone and with all that follow it. The C library's
+// functions are replaced for this program; sanitizers have replaced them already, so there this is left out.
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <span>
+#include <string>
+
+#include "platform/log/Log.h"
+#include "platform/plist/PropertyListCodec.h"
+#include "platform/preferences/linux/TestHome.h"
+
+#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
+
+namespace {
+
+constinit thread_local bool armed = false;
+constinit thread_local bool allFollowing = false;
+constinit thread_local long untilFailure = 0;
+constinit thread_local long failures = 0;
+
+bool failsNow() {
+  if (!armed || untilFailure-- > 0) return false;
+  if (untilFailure != -1 && !allFollowing) return false;
+  ++failures;
+  return true;
+}
+
+}  // namespace
+
+extern "C" {
+void* __libc_malloc(std::size_t size);
+void* __libc_calloc(std::size_t count, std::size_t size);
+void* __libc_realloc(void* memory, std::size_t size);
+void* malloc(std::size_t size) { return failsNow() ? nullptr : __libc_malloc(size); }
+void* calloc(std::size_t count, std::size_t size) {
+  return failsNow() ? nullptr : __libc_calloc(count, size);
+}
+void* realloc(void* memory, std::size_t size) { return failsNow() ? nullptr : __libc_realloc(memory, size); }
+}
+
+namespace brenvik {
+namespace {
+
+constexpr auto kUser = UserScope::currentUser;
+constexpr auto kHost = HostScope::anyHost;
+constexpr const char kDomain[] = "com.example.memory";
+
+class PreferencesMemoryTest : public testing::TestWithParam<bool> {
+ protected:
+  PreferencesMemoryTest() { setLogSink(nullptr); }
+
+  // Runs `work` with one allocation after the other failing, until it needs no more.
+  template <typename Prepare, typename Work>
+  void failEveryAllocation(Prepare prepare, Work work) {
+    long next = 0;
+    while (true) {
+      ASSERT_NO_FATAL_FAILURE(prepare());
+      armed = true;
+      allFollowing = GetParam();
+      untilFailure = next;
+      failures = 0;
+      const bool answer = work();
+      armed = false;
+      SCOPED_TRACE("allocation " + std::to_string(next));
+      ASSERT_NO_FATAL_FAILURE(check(answer));
+      if (failures == 0) break;
+      ++next;
+    }
+    EXPECT_TRUE(wasAnswered) << "without a failure it succeeds";
+    EXPECT_GT(next, 10);
+  }
+
+  void check(bool answer) {
+    wasAnswered = answer;
+    ASSERT_EQ(home.files(), std::vector<std::string>{std::string(kDomain) + ".plist"})
+        << "a good file was moved";
+    const std::string bytes = TestHome::read(home.file(kDomain));
+    const PropertyList stored = parsePropertyList(std::as_bytes(std::span(bytes)));
+    if (answer) {
+      ASSERT_EQ(stored, after);
+    } else {
+      // Each key by itself: one of the values may have been lost when it was set.
+      for (std::size_t i = 0; i < after.size(); ++i) {
+        const PropertyList found = stored.find(after.keyAt(i));
+        ASSERT_TRUE(found == after.at(i) || found == before.find(after.keyAt(i))) << after.keyAt(i);
+      }
+      ASSERT_LE(stored.size(), after.size());
+    }
+  }
+
+  TestHome home;
+  bool wasAnswered = false;
+  const PropertyList value = PropertyList::array({PropertyList::string("new"), PropertyList::integer(7)});
+  const PropertyList before =
+      PropertyList::dictionary({{"key", PropertyList::string("old")},
+                                {"nested", PropertyList::array({PropertyList::dictionary({})})}});
+  PropertyList after = before;
+  std::unique_ptr<FilePreferences> store;
+};
+
+TEST_P(PreferencesMemoryTest, ASetIsStoredWholeOrNotAnsweredAndAGoodFileStaysInItsPlace) {
+  after = before.withEntry("key", value).withEntry("another", value);
+  for (const bool isCached : {false, true}) {
+    failEveryAllocation(
+        [&] {
+          home.write(kDomain, *serializePropertyList(before, PropertyListFormat::binary));
+          store = home.open();
+          if (isCached) {
+            ASSERT_TRUE(store->copyValue("key", kDomain, kUser, kHost));
+          }
+        },
+        [&] {
+          store->setValue("key", value, kDomain, kUser, kHost);
+          store->setValue("another", value, kDomain, kUser, kHost);
+          return store->synchronize(kDomain, kUser, kHost);
+        });
+    // And when there is memory again, all is well.
+    store->setValue("key", value, kDomain, kUser, kHost);
+    store->setValue("another", value, kDomain, kUser, kHost);
+    EXPECT_TRUE(store->synchronize(kDomain, kUser, kHost));
+    EXPECT_EQ(store->copyValue("another", kDomain, kUser, kHost), value);
+  }
+}
+
+TEST_P(PreferencesMemoryTest, AReadGivesTheValueOrNoneAndAGoodFileStaysInItsPlace) {
+  failEveryAllocation(
+      [&] {
+        home.write(kDomain, *serializePropertyList(before, PropertyListFormat::binary));
+        store = home.open();
+      },
+      [&] {
+        const PropertyList found = store->copyApplicationValue("nested", kDomain);
+        armed = false;
+        if (!found) return false;
+        EXPECT_EQ(found, before.find("nested"));
+        return true;
+      });
+}
+
+INSTANTIATE_TEST_SUITE_P(AloneAndWithAllThatFollow, PreferencesMemoryTest, testing::Bool());
+
+}  // namespace
+}  // namespace brenvik
+
+#endif
