@@ -6,11 +6,12 @@ import pathlib
 import plistlib
 import shutil
 import signal
+import tempfile
 import threading
 import time
 
 import wire
-from harness import ERROR, LOG_ERR, Daemon, HelperTest, main
+from harness import ERROR, INFO, LOG_ERR, Daemon, HelperTest, main
 
 DOMAIN = "com.example.test"
 FOLDER = pathlib.Path("/root/Library/Preferences")
@@ -185,6 +186,35 @@ class Descriptors(PreferencesTest):
             self.assertEqual(caller.set_preference(f"domain{number}", "key", xml("x" * 50_000)), 0)
         self.assertLessEqual(self.daemon.descriptors() - before, 16)
         self.assertLess(self.daemon.resident_kib() - memory, 16 * 1024)
+
+
+class PlistFiles(HelperTest):
+    def setUp(self):
+        super().setUp()
+        self.caller = self.client()
+        self.folder = pathlib.Path(tempfile.mkdtemp())
+        self.addCleanup(shutil.rmtree, self.folder)
+
+    def test_any_readable_dictionary_comes_back_as_xml(self):
+        value = {"CarrierName": "Norvale", "MCC": [1, 2]}
+        for number, form in enumerate((xml(value), binary(value))):
+            path = self.folder / f"file {number}"
+            path.write_bytes(form)
+            content = self.caller.load_plist(str(path))
+            self.assertTrue(content.startswith(b"<?xml"))
+            self.assertEqual(plistlib.loads(content), value)
+            self.logs.wait_for("unified", INFO, f"Loading {path} as plist")
+
+    def test_what_is_no_dictionary_gets_9_and_a_line(self):
+        (self.folder / "array").write_bytes(xml([1]))
+        (self.folder / "text").write_bytes(b"no property list")
+        (self.folder / "empty").write_bytes(b"")
+        for name in ("array", "text", "empty", "missing", "."):
+            self.logs.clear()
+            with self.assertRaises(wire.Status) as refusal:
+                self.caller.load_plist(str(self.folder / name))
+            self.assertEqual(refusal.exception.code, 9)
+            self.logs.wait_for("unified", ERROR, "Could not create data representation of dictionary")
 
 
 if __name__ == "__main__":
