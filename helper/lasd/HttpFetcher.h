@@ -7,7 +7,6 @@
 #include <memory>
 #include <span>
 #include <string>
-#include <vector>
 
 #include "platform/gzip/Gunzip.h"
 #include "platform/runloop/WorkQueue.h"
@@ -53,8 +52,8 @@ class HttpFetcher {
 
   const Parts parts_;
   const std::shared_ptr<WorkQueue> queue_;
-  std::vector<std::byte> body_;  // of the last successful response
-  HeaderMap headers_;            // likewise
+  WebBody body_;       // of the last successful response
+  HeaderMap headers_;  // likewise
 };
 
 }  // namespace brenvik

@@ -111,7 +111,7 @@ TEST_F(HttpFetcherTest, A200ThatDidNotArriveWholeFails) {
   WebResponse response;
   response.errorKind = WebErrorKind::connectionLost;
   response.statusCode = 200;
-  response.body.resize(10);
+  response.body.append(std::as_bytes(std::span("0123456789", 10)));
   web.answer(kUrl, response);
   HttpFetcher fetcher(fetcherParts());
   EXPECT_FALSE(fetcher.fetch(kUrl, WifiOnly::yes));

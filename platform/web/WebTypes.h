@@ -2,12 +2,12 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
-#include <cstddef>
 #include <cstdint>
 #include <map>
 #include <string>
 #include <string_view>
-#include <vector>
+
+#include "platform/web/WebBody.h"
 
 // The vocabulary of the HTTP client. RFC 9110.
 namespace brenvik {
@@ -48,7 +48,7 @@ enum class WebErrorKind : std::int32_t {
 struct WebResponse {
   WebErrorKind errorKind = WebErrorKind::unknown;
   int statusCode = 0;  // 0: none came
-  std::vector<std::byte> body;
+  WebBody body;
   HeaderMap headers;
 };
 

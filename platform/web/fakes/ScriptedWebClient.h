@@ -8,6 +8,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <span>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -38,8 +39,7 @@ class ScriptedWebClient final : public WebClient {
     WebResponse response;
     response.errorKind = WebErrorKind::none;
     response.statusCode = statusCode;
-    const auto* bytes = reinterpret_cast<const std::byte*>(body.data());
-    response.body.assign(bytes, bytes + body.size());
+    response.body.append(std::as_bytes(std::span(body)));
     response.headers = std::move(headers);
     answers_[url] = std::move(response);
   }

@@ -15,6 +15,7 @@
 #include <mutex>
 #include <new>
 #include <optional>
+#include <span>
 #include <string_view>
 #include <utility>
 
@@ -205,8 +206,7 @@ std::size_t CurlWebClient::Transfer::onBody(char* data, std::size_t, std::size_t
         body.reserve(std::min<std::uint64_t>(static_cast<std::uint64_t>(announced), transfer.largestBody));
       }
     }
-    const auto* bytes = reinterpret_cast<const std::byte*>(data);
-    body.insert(body.end(), bytes, bytes + size);
+    body.append(std::as_bytes(std::span(data, size)));
     return size;
   } catch (...) {
     transfer.ownVerdict = WebErrorKind::outOfMemory;
