@@ -92,9 +92,9 @@ const fs::path& tree() {
   static const fs::path path = [] {
     const fs::path made = scratch().here / "tree";
     for (int i = 0; i < kFiles; ++i) {
-      const fs::path folder = made / ("d" + std::to_string(i % 20));
+      const fs::path folder = made / std::to_string(i % 20);
       fs::create_directories(folder);
-      fill(folder / ("file" + std::to_string(i)), kSmall, static_cast<std::uint64_t>(i));
+      fill(folder / std::to_string(i), kSmall, static_cast<std::uint64_t>(i));
     }
     return made;
   }();
