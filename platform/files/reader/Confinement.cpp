@@ -49,10 +49,10 @@ bool filterSystemCalls() {
 }  // namespace
 
 bool confineThisProcess() {
-  // In a user namespace there may be no other user to become.
-  (void)::setgroups(0, nullptr);
-  (void)::setresgid(kNobody, kNobody, kNobody);
-  (void)::setresuid(kNobody, kNobody, kNobody);
+  // Only root can, and in a user namespace there may be no other user to become: then the filter has to do.
+  const bool isNobody = ::setgroups(0, nullptr) == 0 && ::setresgid(kNobody, kNobody, kNobody) == 0 &&
+                        ::setresuid(kNobody, kNobody, kNobody) == 0;
+  (void)isNobody;
   if (!limit(RLIMIT_CORE, 0) || !limit(RLIMIT_FSIZE, 0) || !limit(RLIMIT_CPU, kProcessorSeconds) ||
       !limit(RLIMIT_AS, kAddressSpace) || ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) {
     return false;
