@@ -114,7 +114,8 @@ struct [[gnu::packed]] SetPreferenceValueRequest {
   std::uint32_t valueLength;
 };
 static_assert(sizeof(SetPreferenceValueRequest) == 568 && offsetof(SetPreferenceValueRequest, value) == 28 &&
-              offsetof(SetPreferenceValueRequest, ndr) == 44 && offsetof(SetPreferenceValueRequest, domain) == 52 &&
+              offsetof(SetPreferenceValueRequest, ndr) == 44 &&
+              offsetof(SetPreferenceValueRequest, domain) == 52 &&
               offsetof(SetPreferenceValueRequest, key) == 308 &&
               offsetof(SetPreferenceValueRequest, valueLength) == 564);
 
@@ -138,7 +139,8 @@ struct [[gnu::packed]] StatusReply {
   NdrRecord ndr;
   KernelReturn returnCode;
 };
-static_assert(sizeof(StatusReply) == 36 && offsetof(StatusReply, ndr) == 24 && offsetof(StatusReply, returnCode) == 32);
+static_assert(sizeof(StatusReply) == 36 && offsetof(StatusReply, ndr) == 24 &&
+              offsetof(StatusReply, returnCode) == 32);
 
 struct [[gnu::packed]] IntegerReply {
   StatusReply status;

@@ -15,12 +15,18 @@ enum class ReplyForm : std::uint8_t { status, integer, string64, string256, outO
 
 constexpr std::size_t sizeOfReply(ReplyForm form) noexcept {
   switch (form) {
-    case ReplyForm::status: return sizeof(StatusReply);
-    case ReplyForm::integer: return sizeof(IntegerReply);
-    case ReplyForm::string64: return sizeof(String64Reply);
-    case ReplyForm::string256: return sizeof(String256Reply);
-    case ReplyForm::outOfLine: return sizeof(OutOfLineReply);
-    case ReplyForm::checkIn: return sizeof(CheckInReply);
+    case ReplyForm::status:
+      return sizeof(StatusReply);
+    case ReplyForm::integer:
+      return sizeof(IntegerReply);
+    case ReplyForm::string64:
+      return sizeof(String64Reply);
+    case ReplyForm::string256:
+      return sizeof(String256Reply);
+    case ReplyForm::outOfLine:
+      return sizeof(OutOfLineReply);
+    case ReplyForm::checkIn:
+      return sizeof(CheckInReply);
   }
   return 0;
 }
@@ -29,25 +35,27 @@ struct RoutineFacts {
   std::int32_t id;
   std::string_view name;
   std::uint32_t requestSize;
-  std::uint32_t descriptors;       // 0: a simple request; else complex with exactly so many
-  std::uint32_t lengthsOffset;     // complex: where the body repeats the descriptors' sizes, u32 each, in order
+  std::uint32_t descriptors;    // 0: a simple request; else complex with exactly so many
+  std::uint32_t lengthsOffset;  // complex: where the body repeats the descriptors' sizes, u32 each, in order
   ReplyForm reply;
 };
 
-inline constexpr RoutineFacts kCheckInRoutine{4792174, "BVMobileHelperCheckIn",  sizeof(CheckInRequest), 1, 0,
-                                              ReplyForm::checkIn};
+inline constexpr RoutineFacts kCheckInRoutine{4792174, "BVMobileHelperCheckIn", sizeof(CheckInRequest), 1,
+                                              0,       ReplyForm::checkIn};
 
 inline constexpr std::int32_t kFirstRequestId = 8683549;
 
 inline constexpr std::array kRequestRoutines{
-    RoutineFacts{8683549, "BVMobileHelperSetVoicemailToken", sizeof(String256Request), 0, 0, ReplyForm::status},
+    RoutineFacts{8683549, "BVMobileHelperSetVoicemailToken", sizeof(String256Request), 0, 0,
+                 ReplyForm::status},
     RoutineFacts{8683550, "BVMobileHelperSetVoicemailTokenForKey", sizeof(TwoStrings256Request), 0, 0,
                  ReplyForm::status},
     RoutineFacts{8683551, "BVMobileHelperClearVoicemailToken", sizeof(EmptyRequest), 0, 0, ReplyForm::status},
     RoutineFacts{8683552, "BVMobileHelperResetVoicemailStore", sizeof(EmptyRequest), 0, 0, ReplyForm::status},
     RoutineFacts{8683553, "BVMobileHelperCopyVoicemailTokenForKey", sizeof(String256Request), 0, 0,
                  ReplyForm::string256},
-    RoutineFacts{8683554, "BVMobileHelperCopyVoicemailToken", sizeof(EmptyRequest), 0, 0, ReplyForm::string256},
+    RoutineFacts{8683554, "BVMobileHelperCopyVoicemailToken", sizeof(EmptyRequest), 0, 0,
+                 ReplyForm::string256},
     RoutineFacts{8683555, "BVMobileHelperSetPreferenceValue", sizeof(SetPreferenceValueRequest), 1,
                  offsetof(SetPreferenceValueRequest, valueLength), ReplyForm::status},
     RoutineFacts{8683556, "BVMobileHelperCopyPreferenceValue", sizeof(TwoStrings256Request), 0, 0,
@@ -56,7 +64,8 @@ inline constexpr std::array kRequestRoutines{
                  ReplyForm::outOfLine},
     RoutineFacts{8683558, "BVMobileHelperReplaceCarrierSymlink", sizeof(ThreeStrings1024Request), 0, 0,
                  ReplyForm::status},
-    RoutineFacts{8683559, "BVMobileHelperCreateSymlink", sizeof(TwoStrings1024Request), 0, 0, ReplyForm::status},
+    RoutineFacts{8683559, "BVMobileHelperCreateSymlink", sizeof(TwoStrings1024Request), 0, 0,
+                 ReplyForm::status},
     RoutineFacts{8683560, "BVMobileHelperRemoveCarrierFile", sizeof(TwoStrings1024Request), 0, 0,
                  ReplyForm::status},
     RoutineFacts{8683561, "BVMobileHelperIsVoicemailServiceSubscribed", sizeof(EmptyRequest), 0, 0,
@@ -75,8 +84,10 @@ inline constexpr std::array kRequestRoutines{
                  ReplyForm::status},
     RoutineFacts{8683570, "BVMobileHelperEnableRadioManagerLogs", sizeof(IntegerRequest), 0, 0,
                  ReplyForm::status},
-    RoutineFacts{8683571, "BVMobileHelperUnpackArchive", sizeof(TwoStrings256Request), 0, 0, ReplyForm::integer},
-    RoutineFacts{8683572, "BVMobileHelperLoadPlistFile", sizeof(String256Request), 0, 0, ReplyForm::outOfLine},
+    RoutineFacts{8683571, "BVMobileHelperUnpackArchive", sizeof(TwoStrings256Request), 0, 0,
+                 ReplyForm::integer},
+    RoutineFacts{8683572, "BVMobileHelperLoadPlistFile", sizeof(String256Request), 0, 0,
+                 ReplyForm::outOfLine},
     RoutineFacts{8683573, "BVMobileHelperCopyBadgeLabels", sizeof(LabelsRequest), 2,
                  offsetof(LabelsRequest, labelsLength), ReplyForm::outOfLine},
     RoutineFacts{8683574, "BVMobileHelperCopyLocalizedLabels", sizeof(LabelsRequest), 2,

@@ -40,8 +40,8 @@ class EntryPointTest : public testing::Test {
   FakeBootstrap bootstrap{ports};
   FakePortSources sources;
   PortServerRegistry registry;
-  ServerPlatform platform{ports, bootstrap, sources, loop, [](const char*, const AuditToken&) { return true; },
-                          registry};
+  ServerPlatform platform{
+      ports, bootstrap, sources, loop, [](const char*, const AuditToken&) { return true; }, registry};
   NoRoutines requests;
   FakeBasebandLibrary baseband;
   RecordingLog log;
@@ -84,10 +84,11 @@ TEST_F(EntryPointTest, ALibraryThatMakesNoServerHostsNone) {
 TEST_F(EntryPointTest, AServiceThatCannotBeSetUpIsLoggedTwiceAndExitsWith1AfterStoppingTheHostedServer) {
   bootstrap.refuseWith = kern::noAccess;
   EXPECT_EQ(runHelper(baseband, platform, requests), 1);
-  EXPECT_EQ(log.entries(),
-            (std::vector{
-                RecordingLog::unifiedLine(LogLevel::error, "unable to create server objects - out of resources"),
-                RecordingLog::unifiedLine(LogLevel::error, "unable to startup BrenvikMobileHelper server")}));
+  EXPECT_EQ(
+      log.entries(),
+      (std::vector{
+          RecordingLog::unifiedLine(LogLevel::error, "unable to create server objects - out of resources"),
+          RecordingLog::unifiedLine(LogLevel::error, "unable to startup BrenvikMobileHelper server")}));
   EXPECT_EQ(baseband.record, "canHost create start stop release ");
   EXPECT_EQ(loop.runs, 0);
 }

@@ -4,7 +4,6 @@
 
 #include "Helper/Shared/Server/HelperServerUtils.h"
 #include "helper/carrier/CarrierOperations.h"
-#include "helper/requests/ServerRoutines.h"
 #include "helper/heartbeat/CellularHeartbeat.h"
 #include "helper/labels/ChannelRemap.h"
 #include "helper/labels/LabelRoutines.h"
@@ -12,6 +11,7 @@
 #include "helper/location/LocationRoutines.h"
 #include "helper/mobile/RadioLogging.h"
 #include "helper/preferences/PreferenceTransfer.h"
+#include "helper/requests/ServerRoutines.h"
 #include "helper/voicemail/VoicemailOperations.h"
 
 namespace brenvik {
@@ -52,7 +52,8 @@ class HelperRoutines final : public ServerRoutines {
   KernelReturn server_BVMobileHelperCopyVoicemailToken(PortName port, char* token) override {
     return areas_.voicemail.copyVoicemailToken(port, token);
   }
-  KernelReturn server_BVMobileHelperIsVoicemailServiceSubscribed(PortName port, std::uint8_t* subscribed) override {
+  KernelReturn server_BVMobileHelperIsVoicemailServiceSubscribed(PortName port,
+                                                                 std::uint8_t* subscribed) override {
     return areas_.voicemail.isVoicemailServiceSubscribed(port, subscribed);
   }
   KernelReturn server_BVMobileHelperUnpackArchive(PortName port, char* archivePath, char* destinationPath,

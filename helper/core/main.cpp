@@ -93,8 +93,8 @@ int run() {
     return MobileAccount{mobile.homeDirectory(), mobile.uid(), mobile.gid()};
   };
   PathPolicy policy(mobileAccount);
-  CarrierOperations carrier(FileSystemManager::factory(files), ZipArchiveCopier::factory(), policy, preferences,
-                            mobileAccount);
+  CarrierOperations carrier(FileSystemManager::factory(files), ZipArchiveCopier::factory(), policy,
+                            preferences, mobileAccount);
   ModemManagerLogs radio(queues);
   RadioLogging radioLogging(radio);
 

@@ -11,7 +11,8 @@
 namespace brenvik {
 
 // A serialized property list (XML, no terminating NUL) in a region of its own, on its way to a caller. On
-// success it travels out of line with the reply, and the caller owns it there. Address and length 0: no value.
+// success it travels out of line with the reply, and the caller owns it there. Address and length 0: no
+// value.
 struct OutOfLinePayload {
   void* address = nullptr;
   std::uint32_t length = 0;  // bytes
@@ -19,7 +20,8 @@ struct OutOfLinePayload {
 
 // Copies already serialized bytes into a fresh region. payload->length is set in any case, payload->address
 // only on success; else the allocator's code is returned and nothing is left to free.
-inline KernelReturn fillPayload(RegionAllocator& regions, std::string_view bytes, OutOfLinePayload* payload) noexcept {
+inline KernelReturn fillPayload(RegionAllocator& regions, std::string_view bytes,
+                                OutOfLinePayload* payload) noexcept {
   payload->length = static_cast<std::uint32_t>(bytes.size());
   void* address = nullptr;
   const KernelReturn code = regions.allocate(&address, bytes.size());

@@ -1,8 +1,8 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 //
-// Any datagram with any descriptors, over a real socket, through framing, table and reply. The first byte of the
-// input says which descriptors go along, two bits each: none, a sealed memfd, an unsealed one, a socket.
+// Any datagram with any descriptors, over a real socket, through framing, table and reply. The first byte of
+// the input says which descriptors go along, two bits each: none, a sealed memfd, an unsealed one, a socket.
 
 #include <fcntl.h>
 #include <sys/mman.h>
@@ -51,7 +51,8 @@ struct Server {
 
   Server() {
     routines.payload = {};  // its bytes are no region of ours
-    require(ports.allocateReceiveRight(&port) == kern::success && ports.insertSendRight(port) == kern::success);
+    require(ports.allocateReceiveRight(&port) == kern::success &&
+            ports.insertSendRight(port) == kern::success);
     source = sources.makeRoutineSource(port, table, WantTrailer::no);
     require(source->addTo(*loop));
     client = UniqueFd(::fcntl(ports.sendEnd(port)->get(), F_DUPFD_CLOEXEC, 0));
@@ -68,10 +69,17 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   std::vector<int> fds;
   for (int shift = 0; shift < 8; shift += 2) {
     switch ((data[0] >> shift) & 3) {
-      case 1: fds.push_back(server.sealed.get()); break;
-      case 2: fds.push_back(server.unsealed.get()); break;
-      case 3: fds.push_back(server.client.get()); break;
-      default: break;
+      case 1:
+        fds.push_back(server.sealed.get());
+        break;
+      case 2:
+        fds.push_back(server.unsealed.get());
+        break;
+      case 3:
+        fds.push_back(server.client.get());
+        break;
+      default:
+        break;
     }
   }
   iovec io{const_cast<std::uint8_t*>(data + 1), size - 1};
@@ -96,7 +104,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   std::array<std::byte, kLargestDatagram> answer;
   const ssize_t answered = ::recv(server.client.get(), answer.data(), answer.size(), MSG_DONTWAIT);
   std::uint32_t replyPort = 0;
-  if (size - 1 >= sizeof(MessageHeader)) std::memcpy(&replyPort, data + 1 + offsetof(MessageHeader, replyPort), 4);
+  if (size - 1 >= sizeof(MessageHeader))
+    std::memcpy(&replyPort, data + 1 + offsetof(MessageHeader, replyPort), 4);
   require((answered > 0) == (replyPort != 0));
   if (answered > 0) {
     const auto& header = *reinterpret_cast<const MessageHeader*>(answer.data());

@@ -19,11 +19,13 @@ KernelReturn checkForm(const RoutineFacts& facts, const Request& request) noexce
   if (facts.descriptors == 0) {
     return !request.isComplex() && request.size() == facts.requestSize ? kern::success : mig::badArguments;
   }
-  if (!request.isComplex() || request.size() != facts.requestSize || request.descriptorCount() != facts.descriptors) {
+  if (!request.isComplex() || request.size() != facts.requestSize ||
+      request.descriptorCount() != facts.descriptors) {
     return mig::badArguments;
   }
   for (std::uint32_t i = 0; i < facts.descriptors; ++i) {
-    const auto& region = request.at<OutOfLineDescriptor>(kDescriptorsOffset + i * sizeof(OutOfLineDescriptor));
+    const auto& region =
+        request.at<OutOfLineDescriptor>(kDescriptorsOffset + i * sizeof(OutOfLineDescriptor));
     const auto length = request.at<std::uint32_t>(facts.lengthsOffset + i * sizeof(std::uint32_t));
     if (region.type != kOutOfLineDescriptorType || region.size != length) return mig::typeError;
   }
@@ -113,7 +115,8 @@ constexpr std::array<RoutineTable::Handler, kRequestRoutines.size()> kHandlers{
            }>,
     handle<4, String256Request,
            [](R& r, PortName port, String256Request& m, Reply& reply) {
-             return r.server_BVMobileHelperCopyVoicemailTokenForKey(port, m.text, reply.as<String256Reply>().text);
+             return r.server_BVMobileHelperCopyVoicemailTokenForKey(port, m.text,
+                                                                    reply.as<String256Reply>().text);
            }>,
     handle<5, EmptyRequest,
            [](R& r, PortName port, EmptyRequest&, Reply& reply) {
@@ -121,7 +124,8 @@ constexpr std::array<RoutineTable::Handler, kRequestRoutines.size()> kHandlers{
            }>,
     handle<6, SetPreferenceValueRequest,
            [](R& r, PortName port, SetPreferenceValueRequest& m, Reply&) {
-             return r.server_BVMobileHelperSetPreferenceValue(port, m.domain, m.key, regionOf(m.value), m.value.size);
+             return r.server_BVMobileHelperSetPreferenceValue(port, m.domain, m.key, regionOf(m.value),
+                                                              m.value.size);
            }>,
     handle<7, TwoStrings256Request,
            [](R& r, PortName port, TwoStrings256Request& m, Reply& reply) {
@@ -149,7 +153,8 @@ constexpr std::array<RoutineTable::Handler, kRequestRoutines.size()> kHandlers{
            }>,
     handle<12, EmptyRequest,
            [](R& r, PortName port, EmptyRequest&, Reply& reply) {
-             return r.server_BVMobileHelperIsVoicemailServiceSubscribed(port, reply.as<IntegerReply>().result);
+             return r.server_BVMobileHelperIsVoicemailServiceSubscribed(port,
+                                                                        reply.as<IntegerReply>().result);
            }>,
     handle<13, IntegerRequest,
            [](R& r, PortName port, IntegerRequest& m, Reply&) {
@@ -192,7 +197,8 @@ constexpr std::array<RoutineTable::Handler, kRequestRoutines.size()> kHandlers{
            }>,
     handle<22, TwoStrings256Request,
            [](R& r, PortName port, TwoStrings256Request& m, Reply& reply) {
-             return r.server_BVMobileHelperUnpackArchive(port, m.first, m.second, reply.as<IntegerReply>().result);
+             return r.server_BVMobileHelperUnpackArchive(port, m.first, m.second,
+                                                         reply.as<IntegerReply>().result);
            }>,
     handle<23, String256Request,
            [](R& r, PortName port, String256Request& m, Reply& reply) {
@@ -203,15 +209,15 @@ constexpr std::array<RoutineTable::Handler, kRequestRoutines.size()> kHandlers{
     handle<24, LabelsRequest,
            [](R& r, PortName port, LabelsRequest& m, Reply& reply) {
              return withPayload(reply, [&](OutOfLinePayload* payload) {
-               return r.server_BVMobileHelperCopyBadgeLabels(port, regionOf(m.labels), m.labels.size,
-                                                             regionOf(m.languages), m.languages.size, payload);
+               return r.server_BVMobileHelperCopyBadgeLabels(
+                   port, regionOf(m.labels), m.labels.size, regionOf(m.languages), m.languages.size, payload);
              });
            }>,
     handle<25, LabelsRequest,
            [](R& r, PortName port, LabelsRequest& m, Reply& reply) {
              return withPayload(reply, [&](OutOfLinePayload* payload) {
-               return r.server_BVMobileHelperCopyLocalizedLabels(port, regionOf(m.labels), m.labels.size,
-                                                                 regionOf(m.languages), m.languages.size, payload);
+               return r.server_BVMobileHelperCopyLocalizedLabels(
+                   port, regionOf(m.labels), m.labels.size, regionOf(m.languages), m.languages.size, payload);
              });
            }>,
     handle<26, TwoStrings64Request,

@@ -43,7 +43,8 @@ class RequestTableTest : public testing::Test {
   }
   void write(std::size_t offset, std::uint32_t value) { std::memcpy(message + offset, &value, sizeof value); }
   OutOfLineDescriptor& descriptor(std::uint32_t i) {
-    return *reinterpret_cast<OutOfLineDescriptor*>(message + kDescriptorsOffset + i * sizeof(OutOfLineDescriptor));
+    return *reinterpret_cast<OutOfLineDescriptor*>(message + kDescriptorsOffset +
+                                                   i * sizeof(OutOfLineDescriptor));
   }
 
   // Delivers `size` bytes; the status reply's code, or 0 for a reply of another form.
@@ -223,7 +224,8 @@ TEST_F(RequestTableTest, ArgumentsArriveFromTheirOffsets) {
   fill(288, 256, 'd');
   fill(544, 256, 'n');
   deliver(kRequestRoutines[15]);
-  EXPECT_EQ(routines.texts, (std::vector{std::string(256, 's'), std::string(256, 'd'), std::string(256, 'n')}));
+  EXPECT_EQ(routines.texts,
+            (std::vector{std::string(256, 's'), std::string(256, 'd'), std::string(256, 'n')}));
 
   makeRequest(kRequestRoutines[26]);
   fill(32, 64, 'f');

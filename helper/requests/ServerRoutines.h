@@ -22,10 +22,12 @@ class ServerRoutines {
 
   // Voicemail store; fields of 256 bytes.
   virtual KernelReturn server_BVMobileHelperSetVoicemailToken(PortName port, char* token) = 0;
-  virtual KernelReturn server_BVMobileHelperSetVoicemailTokenForKey(PortName port, char* key, char* token) = 0;
+  virtual KernelReturn server_BVMobileHelperSetVoicemailTokenForKey(PortName port, char* key,
+                                                                    char* token) = 0;
   virtual KernelReturn server_BVMobileHelperClearVoicemailToken(PortName port) = 0;
   virtual KernelReturn server_BVMobileHelperResetVoicemailStore(PortName port) = 0;
-  virtual KernelReturn server_BVMobileHelperCopyVoicemailTokenForKey(PortName port, char* key, char* token) = 0;
+  virtual KernelReturn server_BVMobileHelperCopyVoicemailTokenForKey(PortName port, char* key,
+                                                                     char* token) = 0;
   virtual KernelReturn server_BVMobileHelperCopyVoicemailToken(PortName port, char* token) = 0;
 
   // Preferences; fields of 256 bytes.
@@ -51,7 +53,8 @@ class ServerRoutines {
   virtual KernelReturn server_BVMobileHelperCopyCarrierFile(PortName port, char* sourceDirectory,
                                                             char* destinationDirectory, char* fileName,
                                                             std::uint8_t* success) = 0;
-  virtual KernelReturn server_BVMobileHelperCopyCrashLogs(PortName port, char* path, std::uint8_t* success) = 0;
+  virtual KernelReturn server_BVMobileHelperCopyCrashLogs(PortName port, char* path,
+                                                          std::uint8_t* success) = 0;
   virtual KernelReturn server_BVMobileHelperMoveIntoCarrierBundles(PortName port, char* sourcePath,
                                                                    char* destinationDirectory, char* name,
                                                                    std::uint8_t* success) = 0;
@@ -65,9 +68,10 @@ class ServerRoutines {
   virtual KernelReturn server_BVMobileHelperEnableRadioManagerLogs(PortName port, std::int32_t enable) = 0;
 
   // Fields of 256 bytes.
-  virtual KernelReturn server_BVMobileHelperUnpackArchive(PortName port, char* archivePath, char* destinationPath,
-                                                          std::uint8_t* success) = 0;
-  virtual KernelReturn server_BVMobileHelperLoadPlistFile(PortName port, char* path, OutOfLinePayload* contents) = 0;
+  virtual KernelReturn server_BVMobileHelperUnpackArchive(PortName port, char* archivePath,
+                                                          char* destinationPath, std::uint8_t* success) = 0;
+  virtual KernelReturn server_BVMobileHelperLoadPlistFile(PortName port, char* path,
+                                                          OutOfLinePayload* contents) = 0;
 
   // Labels.
   virtual KernelReturn server_BVMobileHelperCopyBadgeLabels(PortName port, const void* labels,
@@ -75,7 +79,8 @@ class ServerRoutines {
                                                             std::uint32_t languagesLength,
                                                             OutOfLinePayload* badges) = 0;
   virtual KernelReturn server_BVMobileHelperCopyLocalizedLabels(PortName port, const void* labels,
-                                                                std::uint32_t labelsLength, const void* languages,
+                                                                std::uint32_t labelsLength,
+                                                                const void* languages,
                                                                 std::uint32_t languagesLength,
                                                                 OutOfLinePayload* texts) = 0;
 

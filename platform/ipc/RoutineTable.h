@@ -38,8 +38,8 @@ class Request {
     return *reinterpret_cast<const Field*>(bytes_ + offset);
   }
 
-  // Type and size (kMinimalTrailerSize or the whole 52 bytes) are always there; the other fields only when the
-  // size says so.
+  // Type and size (kMinimalTrailerSize or the whole 52 bytes) are always there; the other fields only when
+  // the size says so.
   const MessageTrailer& trailer() const noexcept { return *trailer_; }
 
  private:

@@ -37,7 +37,8 @@ LogSink* setLogSink(LogSink* sink) noexcept;
 // Nothing is allocated; errno is left as it was. logUnified(level, format, ...) is a macro only so that the
 // journal can say where the line came from.
 #define logUnified(...) ::brenvik::logUnifiedAt({__FILE__, __LINE__, __func__}, __VA_ARGS__)
-[[gnu::format(printf, 3, 4)]] void logUnifiedAt(const LogPlace& place, LogLevel level, const char* format, ...) noexcept;
+[[gnu::format(printf, 3, 4)]] void logUnifiedAt(const LogPlace& place, LogLevel level, const char* format,
+                                                ...) noexcept;
 [[gnu::format(printf, 2, 3)]] void logBsd(SyslogPriority priority, const char* format, ...) noexcept;
 
 }  // namespace brenvik

@@ -16,8 +16,9 @@ TEST(LogTest, LinesKeepTheirChannelLevelAndText) {
   RecordingLog log;
   logUnified(LogLevel::info, "Loading %s as plist", "/a");
   logBsd(SyslogPriority::error, "VM_ALLOCATE %ul (mhs1)\n", 12U);
-  EXPECT_EQ(log.entries(), (std::vector{RecordingLog::unifiedLine(LogLevel::info, "Loading /a as plist"),
-                                        RecordingLog::bsdLine(SyslogPriority::error, "VM_ALLOCATE 12l (mhs1)\n")}));
+  EXPECT_EQ(log.entries(),
+            (std::vector{RecordingLog::unifiedLine(LogLevel::info, "Loading /a as plist"),
+                         RecordingLog::bsdLine(SyslogPriority::error, "VM_ALLOCATE 12l (mhs1)\n")}));
 }
 
 TEST(LogTest, LoggingLeavesErrnoAsItWas) {

@@ -58,8 +58,10 @@ class RunLoop {
   // ready at the same moment are served before it. Null when it cannot be made. Any thread, as is the
   // source's destruction; off the loop's thread the timer may still fail to be armed later, and then
   // `failed` runs on the loop's thread in the handler's place.
-  virtual std::unique_ptr<LoopSource> addTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
-                                               std::function<void()> handler, std::function<void()> failed) = 0;
+  virtual std::unique_ptr<LoopSource> addTimer(std::chrono::nanoseconds first,
+                                               std::chrono::nanoseconds interval,
+                                               std::function<void()> handler,
+                                               std::function<void()> failed) = 0;
 };
 
 }  // namespace brenvik

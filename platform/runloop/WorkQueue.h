@@ -18,10 +18,10 @@ namespace brenvik {
 // lowest best-effort I/O priority.
 enum class QualityOfService { standard, utility };
 
-// A serial queue: tasks run one at a time, in the order posted. All members may be called from any thread that
-// keeps the queue alive meanwhile.
-// Destroying the last reference to a queue lets the task that runs finish, drops the tasks and timers that
-// have not started, and joins the queue's thread (unless it is destroyed on that very thread).
+// A serial queue: tasks run one at a time, in the order posted. All members may be called from any thread
+// that keeps the queue alive meanwhile. Destroying the last reference to a queue lets the task that runs
+// finish, drops the tasks and timers that have not started, and joins the queue's thread (unless it is
+// destroyed on that very thread).
 class WorkQueue {
  public:
   using Task = std::function<void()>;
@@ -32,7 +32,8 @@ class WorkQueue {
 
   virtual void post(Task task) = 0;
 
-  // Runs the task once, `delay` from now (a clock that counts while the system sleeps). It cannot be cancelled.
+  // Runs the task once, `delay` from now (a clock that counts while the system sleeps). It cannot be
+  // cancelled.
   virtual void postAfter(std::chrono::nanoseconds delay, Task task) = 0;
 
   // A timer whose handler runs on this queue: first after `first`, then every `interval`; a firing may be put

@@ -12,8 +12,8 @@ class ServerContext;
 // With all 32 out, the first is given again (1). Any thread.
 std::uint32_t AcquireBusyToken(ServerContext& server);
 
-// Gives a token back: 1 when it was well formed (exactly one bit set), else 0 and nothing changes. Giving back
-// the last one while no client is checked in starts the idle countdown. Any thread.
+// Gives a token back: 1 when it was well formed (exactly one bit set), else 0 and nothing changes. Giving
+// back the last one while no client is checked in starts the idle countdown. Any thread.
 std::uint32_t ReleaseBusyToken(ServerContext& server, std::uint32_t token);
 
 }  // namespace brenvik

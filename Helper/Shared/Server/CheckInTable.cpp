@@ -49,7 +49,9 @@ Outcome checkIn(void* context, const Request& request, Reply& reply) {
 class CheckInTable final : public RoutineTable {
  public:
   explicit CheckInTable(const ServerPlatform& platform) noexcept : platform_(platform) {}
-  Handler find(std::int32_t id) const noexcept override { return id == kCheckInRoutine.id ? &checkIn : nullptr; }
+  Handler find(std::int32_t id) const noexcept override {
+    return id == kCheckInRoutine.id ? &checkIn : nullptr;
+  }
   void* context() const noexcept override { return const_cast<ServerPlatform*>(&platform_); }
 
  private:

@@ -50,7 +50,8 @@ void cancelIdleTimer(ServerContext& server) {
 }
 
 // Lock held.
-void TearDownClient(ServerContext& server, const std::shared_ptr<DeathWatch>& deathWatch, PortName clientPort) {
+void TearDownClient(ServerContext& server, const std::shared_ptr<DeathWatch>& deathWatch,
+                    PortName clientPort) {
   const ServerPlatform& platform = server.platform;
   if (deathWatch != nullptr) {
     deathWatch->setInvalidationCallback({});
@@ -71,9 +72,10 @@ void TearDownClient(ServerContext& server, const std::shared_ptr<DeathWatch>& de
   }
 }
 
-[[noreturn]] void assertionFailed(const char* expression, const char* function, const char* source, int line) {
-  logUnified(LogLevel::error, "Assertion failed: (%s), function %s, file %s, line %d.", expression, function, source,
-             line);
+[[noreturn]] void assertionFailed(const char* expression, const char* function, const char* source,
+                                  int line) {
+  logUnified(LogLevel::error, "Assertion failed: (%s), function %s, file %s, line %d.", expression, function,
+             source, line);
   std::abort();
 }
 
@@ -89,7 +91,8 @@ ServerContext* CreateServer(const ServerPlatform& platform, const char* serviceN
     server->servicePort = port;
     platform.registry.add(port, server);
     server->checkInSubsystem = makeCheckInTable(platform);
-    server->serviceSource = platform.sources.makeRoutineSource(port, *server->checkInSubsystem, WantTrailer::yes);
+    server->serviceSource =
+        platform.sources.makeRoutineSource(port, *server->checkInSubsystem, WantTrailer::yes);
     if (server->serviceSource != nullptr && server->serviceSource->addTo(platform.loop)) return server;
   }
   // After a successful check-in DestroyServer drops the same right again, to no effect.
@@ -170,10 +173,13 @@ std::uint32_t ReleaseBusyToken(ServerContext& server, std::uint32_t token) {
   return 1;
 }
 
-ServerContext* LookupServer(PortServerRegistry& registry, PortName port) noexcept { return registry.lookUp(port); }
+ServerContext* LookupServer(PortServerRegistry& registry, PortName port) noexcept {
+  return registry.lookUp(port);
+}
 
-KernelReturn BVMobileHelperCheckIn(PortServerRegistry& registry, const ServerPlatform& platform, PortName servicePort,
-                                   PortName callerPort, PortName* clientPort, const AuditToken& caller) {
+KernelReturn BVMobileHelperCheckIn(PortServerRegistry& registry, const ServerPlatform& platform,
+                                   PortName servicePort, PortName callerPort, PortName* clientPort,
+                                   const AuditToken& caller) {
   *clientPort = kNullPort;
   if (!platform.hasEntitlement(kAllowEntitlement, caller)) return kern::invalidSecurity;
   ServerContext* const server = LookupServer(registry, servicePort);
@@ -225,7 +231,8 @@ KernelReturn BVMobileHelperCheckIn(PortServerRegistry& registry, const ServerPla
     return kern::failure;
   }
   cancelIdleTimer(*server);
-  if (!deathWatch->isValid()) return kern::failure;  // the callback, already on its way, tears the client down
+  if (!deathWatch->isValid())
+    return kern::failure;  // the callback, already on its way, tears the client down
   *clientPort = port;
   return kern::success;
 }

@@ -38,8 +38,8 @@ struct ServerPlatform {
 class ServerContext;
 
 // Checks the service name in and serves the check-in routine on its port; clients will be served
-// `clientSubsystem`, which outlives the server. Null when the service could not be set up (an error is logged,
-// unless memory ran out at once). The caller destroys the server with DestroyServer.
+// `clientSubsystem`, which outlives the server. Null when the service could not be set up (an error is
+// logged, unless memory ran out at once). The caller destroys the server with DestroyServer.
 ServerContext* CreateServer(const ServerPlatform& platform, const char* serviceName,
                             const RoutineTable& clientSubsystem);
 
@@ -60,11 +60,12 @@ void DestroyServer(ServerContext* server);
 ServerContext* LookupServer(PortServerRegistry& registry, PortName port) noexcept;
 
 // Admits the caller when it holds the entitlement: makes it a receive port of its own that serves the client
-// subsystem until `callerPort` dies. Results: kern::success and *clientPort; kern::invalidSecurity, and nothing
-// is changed; the code of the failed port call; kern::failure when a source could not be made or the caller's
-// port was dead already. *clientPort is 0 unless a port was made.
-KernelReturn BVMobileHelperCheckIn(PortServerRegistry& registry, const ServerPlatform& platform, PortName servicePort,
-                                   PortName callerPort, PortName* clientPort, const AuditToken& caller);
+// subsystem until `callerPort` dies. Results: kern::success and *clientPort; kern::invalidSecurity, and
+// nothing is changed; the code of the failed port call; kern::failure when a source could not be made or the
+// caller's port was dead already. *clientPort is 0 unless a port was made.
+KernelReturn BVMobileHelperCheckIn(PortServerRegistry& registry, const ServerPlatform& platform,
+                                   PortName servicePort, PortName callerPort, PortName* clientPort,
+                                   const AuditToken& caller);
 
 // Runs when a client's port has died: tears the client down and, when it was the last and nothing is busy,
 // starts the idle countdown.

@@ -33,7 +33,8 @@ class ServerTest : public testing::Test {
 
   KernelReturn checkIn() {
     callerPort = ports.adoptSendRight();
-    return BVMobileHelperCheckIn(registry, platform, server->servicePort, callerPort, &clientPort, AuditToken{});
+    return BVMobileHelperCheckIn(registry, platform, server->servicePort, callerPort, &clientPort,
+                                 AuditToken{});
   }
   // The client whose check-in was the n-th dies.
   void clientDies(std::size_t n) { sources.deathWatches.at(n)->tellDeath(); }
@@ -47,7 +48,10 @@ class ServerTest : public testing::Test {
   PortServerRegistry registry;
   bool entitled = true;
   std::string askedEntitlement;
-  ServerPlatform platform{ports, bootstrap, sources, loop,
+  ServerPlatform platform{ports,
+                          bootstrap,
+                          sources,
+                          loop,
                           [this](const char* name, const AuditToken&) {
                             askedEntitlement = name;
                             return entitled;
@@ -424,7 +428,8 @@ TEST_F(ServerTest, ADeathThatBelongsToNoServerStopsTheProcessOnAnAssertion) {
         setLogSink(&sink);
         OnClientPortDied(stray, nullptr, registry);
       },
-      "Assertion failed: \\(server\\), function MachPortInvalidationCallBack, file HelperServerUtils, line 317");
+      "Assertion failed: \\(server\\), function MachPortInvalidationCallBack, file HelperServerUtils, line "
+      "317");
 }
 
 // ---- the check-in handler: form first, then the routine ----

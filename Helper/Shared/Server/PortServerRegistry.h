@@ -11,8 +11,8 @@ namespace brenvik {
 
 class ServerContext;
 
-// Which server owns a port: its service port, every client's receive port and every client's death-watch port.
-// Any thread. Its lock is taken inside a server's own, never the other way round.
+// Which server owns a port: its service port, every client's receive port and every client's death-watch
+// port. Any thread. Its lock is taken inside a server's own, never the other way round.
 class PortServerRegistry {
  public:
   // The process's own; made on first use, released at exit. Tests make private ones.

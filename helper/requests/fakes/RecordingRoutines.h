@@ -68,7 +68,8 @@ class RecordingRoutines final : public ServerRoutines {
   KernelReturn server_BVMobileHelperRemoveCarrierFile(PortName p, char* path, char* domain) override {
     return note("RemoveCarrierFile", p, {text(path, 1024), text(domain, 1024)});
   }
-  KernelReturn server_BVMobileHelperIsVoicemailServiceSubscribed(PortName p, std::uint8_t* subscribed) override {
+  KernelReturn server_BVMobileHelperIsVoicemailServiceSubscribed(PortName p,
+                                                                 std::uint8_t* subscribed) override {
     *subscribed = 1;
     return note("IsVoicemailServiceSubscribed", p, {});
   }
@@ -89,12 +90,13 @@ class RecordingRoutines final : public ServerRoutines {
     *success = 1;
     return note("CopyCrashLogs", p, {text(path, 256)});
   }
-  KernelReturn server_BVMobileHelperMoveIntoCarrierBundles(PortName p, char* source, char* destination, char* name,
-                                                           std::uint8_t* success) override {
+  KernelReturn server_BVMobileHelperMoveIntoCarrierBundles(PortName p, char* source, char* destination,
+                                                           char* name, std::uint8_t* success) override {
     *success = 1;
     return note("MoveIntoCarrierBundles", p, {text(source, 256), text(destination, 256), text(name, 256)});
   }
-  KernelReturn server_BVMobileHelperRequestCountryCodeFromLocation(PortName p, double lat, double lon) override {
+  KernelReturn server_BVMobileHelperRequestCountryCodeFromLocation(PortName p, double lat,
+                                                                   double lon) override {
     latitude = lat;
     longitude = lon;
     return note("RequestCountryCodeFromLocation", p, {});
@@ -115,20 +117,23 @@ class RecordingRoutines final : public ServerRoutines {
     *success = 1;
     return note("UnpackArchive", p, {text(archive, 256), text(destination, 256)});
   }
-  KernelReturn server_BVMobileHelperLoadPlistFile(PortName p, char* path, OutOfLinePayload* contents) override {
+  KernelReturn server_BVMobileHelperLoadPlistFile(PortName p, char* path,
+                                                  OutOfLinePayload* contents) override {
     *contents = payload;
     return note("LoadPlistFile", p, {text(path, 256)});
   }
-  KernelReturn server_BVMobileHelperCopyBadgeLabels(PortName p, const void* labels, std::uint32_t labelsLength,
-                                                    const void* languages, std::uint32_t languagesLength,
+  KernelReturn server_BVMobileHelperCopyBadgeLabels(PortName p, const void* labels,
+                                                    std::uint32_t labelsLength, const void* languages,
+                                                    std::uint32_t languagesLength,
                                                     OutOfLinePayload* badges) override {
     firstRegion.assign(static_cast<const char*>(labels), labelsLength);
     secondRegion.assign(static_cast<const char*>(languages), languagesLength);
     *badges = payload;
     return note("CopyBadgeLabels", p, {});
   }
-  KernelReturn server_BVMobileHelperCopyLocalizedLabels(PortName p, const void* labels, std::uint32_t labelsLength,
-                                                        const void* languages, std::uint32_t languagesLength,
+  KernelReturn server_BVMobileHelperCopyLocalizedLabels(PortName p, const void* labels,
+                                                        std::uint32_t labelsLength, const void* languages,
+                                                        std::uint32_t languagesLength,
                                                         OutOfLinePayload* localized) override {
     firstRegion.assign(static_cast<const char*>(labels), labelsLength);
     secondRegion.assign(static_cast<const char*>(languages), languagesLength);

@@ -15,7 +15,8 @@ Value read(std::span<const std::byte> datagram, std::size_t offset) noexcept {
 }
 
 constexpr std::size_t kTypeOffset = offsetof(PortDescriptor, type);
-static_assert(kTypeOffset == offsetof(OutOfLineDescriptor, type), "the walk tells descriptors apart by this byte");
+static_assert(kTypeOffset == offsetof(OutOfLineDescriptor, type),
+              "the walk tells descriptors apart by this byte");
 
 constexpr std::size_t roundUp8(std::size_t value) noexcept { return (value + 7) & ~std::size_t{7}; }
 
@@ -48,7 +49,8 @@ std::optional<WalkedDescriptor> DescriptorCursor::next() noexcept {
   const auto descriptor = read<OutOfLineDescriptor>(datagram_, at_);
   WalkedDescriptor found{WalkedDescriptor::Kind::emptyRegion, at_, 0, descriptor.size};
   if (descriptor.size != 0) {
-    found.kind = descriptor.address != 0 ? WalkedDescriptor::Kind::inLineRegion : WalkedDescriptor::Kind::memfdRegion;
+    found.kind =
+        descriptor.address != 0 ? WalkedDescriptor::Kind::inLineRegion : WalkedDescriptor::Kind::memfdRegion;
     found.regionOffset = descriptor.address;
   }
   at_ += sizeof(OutOfLineDescriptor);
@@ -63,7 +65,8 @@ std::optional<DescriptorWalk> walkDescriptors(std::span<const std::byte> datagra
   if (inLine) {
     // The message ends where its sender says, or the regions behind it could be read as descriptors.
     end = read<std::uint32_t>(datagram, offsetof(MessageHeader, size));
-    if (end > datagram.size() || end < kDescriptorsOffset || !hasInLineRegion(datagram, end)) return std::nullopt;
+    if (end > datagram.size() || end < kDescriptorsOffset || !hasInLineRegion(datagram, end))
+      return std::nullopt;
   }
   walk.messageSize = static_cast<std::uint32_t>(end);
 
@@ -72,8 +75,11 @@ std::optional<DescriptorWalk> walkDescriptors(std::span<const std::byte> datagra
   while (const auto descriptor = cursor.next()) {
     switch (descriptor->kind) {
       case WalkedDescriptor::Kind::port:
-      case WalkedDescriptor::Kind::memfdRegion: ++walk.rights; break;
-      case WalkedDescriptor::Kind::emptyRegion: break;
+      case WalkedDescriptor::Kind::memfdRegion:
+        ++walk.rights;
+        break;
+      case WalkedDescriptor::Kind::emptyRegion:
+        break;
       case WalkedDescriptor::Kind::inLineRegion: {
         const std::size_t start = descriptor->regionOffset;
         if (regionsEnd == 0 ? start != roundUp8(end) : start < regionsEnd) return std::nullopt;

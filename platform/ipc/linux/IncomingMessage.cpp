@@ -76,7 +76,7 @@ IncomingMessage::Received IncomingMessage::receive(int fd) noexcept {
 bool IncomingMessage::mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept {
   const int seals = ::fcntl(fd, F_GET_SEALS);
   if (seals < 0 || (seals & kNeededSeals) != kNeededSeals) return false;
-  struct stat status{};
+  struct stat status {};
   if (::fstat(fd, &status) != 0 || status.st_size < static_cast<off_t>(length)) return false;
   void* const mapped = ::mmap(nullptr, length, PROT_READ, MAP_SHARED, fd, 0);
   if (mapped == MAP_FAILED) return false;

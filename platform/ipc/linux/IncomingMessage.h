@@ -70,7 +70,8 @@ class IncomingMessage {
   std::array<PortName, kMostRights> names_;
   struct Storage {
     alignas(16) std::array<std::byte, kLargestDatagram> bytes;
-    alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * kMostRights) + CMSG_SPACE(sizeof(ucred))> control;
+    alignas(
+        cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * kMostRights) + CMSG_SPACE(sizeof(ucred))> control;
   };
   Storage storage_;
 };

@@ -11,8 +11,8 @@
 
 namespace brenvik {
 
-// The trailer of a message from what the kernel attached to it, and from /proc for what the credentials do not
-// say. A sender that has gone by now has pid version 0.
+// The trailer of a message from what the kernel attached to it, and from /proc for what the credentials do
+// not say. A sender that has gone by now has pid version 0.
 MessageTrailer buildTrailer(const ucred& sender, std::uint32_t sequence) noexcept;
 
 // The trailer of a message nobody asked a trailer for: type and size only.

@@ -23,8 +23,8 @@
 namespace brenvik {
 namespace {
 
-// Two instances that start together settle who is first under a lock; the loser waits about as long as a start
-// takes, not for ever.
+// Two instances that start together settle who is first under a lock; the loser waits about as long as a
+// start takes, not for ever.
 constexpr int kLockTries = 100;
 constexpr std::chrono::milliseconds kLockPause{10};
 
@@ -55,9 +55,11 @@ UniqueFd SystemBootstrap::fromServiceManager(const char* serviceName) noexcept {
     UniqueFd given(SD_LISTEN_FDS_START + i);
     const bool ours = names != nullptr && std::strcmp(names[i], serviceName) == 0;
     if (!ours || chosen.isValid()) {
-      logUnified(LogLevel::error, "passed over a listening descriptor named \"%s\"", names != nullptr ? names[i] : "");
+      logUnified(LogLevel::error, "passed over a listening descriptor named \"%s\"",
+                 names != nullptr ? names[i] : "");
     } else if (sd_is_socket_unix(given.get(), SOCK_SEQPACKET, 1, nullptr, 0) <= 0) {
-      logUnified(LogLevel::error, "the descriptor named \"%s\" is no listening SOCK_SEQPACKET socket", serviceName);
+      logUnified(LogLevel::error, "the descriptor named \"%s\" is no listening SOCK_SEQPACKET socket",
+                 serviceName);
     } else {
       chosen = std::move(given);
     }
@@ -87,7 +89,7 @@ UniqueFd SystemBootstrap::listenAt(const std::string& path, const char* serviceN
     return {};
   }
 
-  struct stat status{};
+  struct stat status {};
   if (::lstat(path.c_str(), &status) == 0) {
     if (!S_ISSOCK(status.st_mode)) {
       logUnified(LogLevel::error, "%s is not a socket, and stays as it is", path.c_str());
@@ -102,7 +104,8 @@ UniqueFd SystemBootstrap::listenAt(const std::string& path, const char* serviceN
 
   UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
   // Anybody may ask; who is refused is decided by entitlement.
-  if (!socket.isValid() || ::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
+  if (!socket.isValid() ||
+      ::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
       ::chmod(path.c_str(), 0666) != 0 || ::listen(socket.get(), SOMAXCONN) != 0) {
     logUnified(LogLevel::error, "cannot listen at %s: %s", path.c_str(), std::strerror(errno));
     return {};

@@ -54,7 +54,8 @@ Sent sendReply(int fd, OutgoingReply& reply) noexcept {
   message.msg_iov = io.data();
   message.msg_iovlen = reply.region != nullptr ? 2 : 1;
   alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
-  const int passed = reply.memfd.isValid() ? reply.memfd.get() : (reply.right != nullptr ? reply.right->get() : -1);
+  const int passed =
+      reply.memfd.isValid() ? reply.memfd.get() : (reply.right != nullptr ? reply.right->get() : -1);
   if (passed >= 0) {
     message.msg_control = control.data();
     message.msg_controllen = control.size();
@@ -122,7 +123,8 @@ class Channel : public std::enable_shared_from_this<Channel> {
       if (received == IncomingMessage::Received::nothing) break;
       const bool answerWanted = incoming_.hasHeader() && incoming_.header().replyPort != kNullPort;
       serve();
-      // Who waits for an answer sends nothing meanwhile: looking once more would cost a system call for nothing.
+      // Who waits for an answer sends nothing meanwhile: looking once more would cost a system call for
+      // nothing.
       if (answerWanted) break;
     }
     if (owner_ != nullptr && pending_ == nullptr && (events & (EPOLLHUP | EPOLLERR)) != 0 &&
@@ -253,9 +255,13 @@ void Channel::answer(OutgoingReply& reply, bool wanted) noexcept {
   }
   if (!wanted) return finish(reply);
   switch (sendReply(fd_->get(), reply)) {
-    case Sent::done: return finish(reply);
-    case Sent::failed: finish(reply); return end();
-    case Sent::channelFull: break;
+    case Sent::done:
+      return finish(reply);
+    case Sent::failed:
+      finish(reply);
+      return end();
+    case Sent::channelFull:
+      break;
   }
   pending_.reset(new (std::nothrow) OutgoingReply(std::move(reply)));
   if (pending_ == nullptr || !source_->setEvents(EPOLLOUT)) {
@@ -273,7 +279,8 @@ class PortSource final : public RoutineSource, private ChannelOwner {
 
   void setChannel(SystemPortSpace& ports, SystemRegions& regions, IncomingMessage& incoming,
                   SystemPortSpace::SharedFd fd) {
-    channel_ = std::make_shared<Channel>(static_cast<ChannelOwner&>(*this), ports, regions, incoming, std::move(fd));
+    channel_ =
+        std::make_shared<Channel>(static_cast<ChannelOwner&>(*this), ports, regions, incoming, std::move(fd));
   }
   bool addTo(RunLoop& loop) noexcept override {
     try {
@@ -307,7 +314,8 @@ class PortSource final : public RoutineSource, private ChannelOwner {
 class ServiceSource final : public RoutineSource, private ChannelOwner {
  public:
   ServiceSource(PortName port, const RoutineTable& table, WantTrailer trailer, SystemPortSpace& ports,
-                SystemRegions& regions, IncomingMessage& incoming, SystemPortSpace::SharedFd listening) noexcept
+                SystemRegions& regions, IncomingMessage& incoming,
+                SystemPortSpace::SharedFd listening) noexcept
       : port_(port),
         table_(table),
         trailer_(trailer),
@@ -340,7 +348,8 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   std::uint32_t nextSequence() noexcept override { return sequence_++; }
   void admitted(Channel& channel) noexcept override { channel.isAdmitted = true; }
   void ended(Channel& channel) noexcept override {
-    channels_.remove_if([&channel](const std::shared_ptr<Channel>& other) { return other.get() == &channel; });
+    channels_.remove_if(
+        [&channel](const std::shared_ptr<Channel>& other) { return other.get() == &channel; });
   }
 
   static UniqueFd openSpare() noexcept { return UniqueFd(::open("/dev/null", O_RDONLY | O_CLOEXEC)); }
@@ -373,8 +382,8 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
 
   void serve(UniqueFd connection) {
     if (!spare_.isValid()) spare_ = openSpare();
-    // A connection made before the listening socket asked for credentials (a client that started this process)
-    // has not taken that over on every kernel.
+    // A connection made before the listening socket asked for credentials (a client that started this
+    // process) has not taken that over on every kernel.
     const int on = 1;
     if (trailer_ == WantTrailer::yes) {
       (void)::setsockopt(connection.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on);
@@ -394,7 +403,8 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
     };
     if (static_cast<std::size_t>(std::count_if(channels_.begin(), channels_.end(), sameAccount)) >
             kMostUnadmittedOfOneAccount ||
-        static_cast<std::size_t>(std::count_if(channels_.begin(), channels_.end(), unadmitted)) > kMostUnadmitted) {
+        static_cast<std::size_t>(std::count_if(channels_.begin(), channels_.end(), unadmitted)) >
+            kMostUnadmitted) {
       (void)closeOldestOfBusiestAccount(2);
     }
     // Its check-in is most often there already, and then needs no wake-up of its own.
@@ -486,7 +496,8 @@ std::shared_ptr<RoutineSource> SystemPortSources::makeRoutineSource(PortName por
   if (end == nullptr) return nullptr;
   try {
     if (ports_.isService(port)) {
-      return std::make_shared<ServiceSource>(port, table, trailer, ports_, regions_, *incoming_, std::move(end));
+      return std::make_shared<ServiceSource>(port, table, trailer, ports_, regions_, *incoming_,
+                                             std::move(end));
     }
     auto source = std::make_shared<PortSource>(port, table, trailer);
     source->setChannel(ports_, regions_, *incoming_, std::move(end));
@@ -496,7 +507,8 @@ std::shared_ptr<RoutineSource> SystemPortSources::makeRoutineSource(PortName por
   }
 }
 
-std::shared_ptr<DeathWatch> SystemPortSources::makeDeathWatch(PortName port, RunLoop& loop, void* info) noexcept {
+std::shared_ptr<DeathWatch> SystemPortSources::makeDeathWatch(PortName port, RunLoop& loop,
+                                                              void* info) noexcept {
   auto end = ports_.sendEnd(port);
   if (end == nullptr) return nullptr;
   try {

@@ -13,10 +13,11 @@ namespace brenvik {
 
 // Routine sources and death watches on the ports of a SystemPortSpace.
 //
-// A source takes further messages of a channel without another wake-up only while the sender does not wait for
-// answers, and never more than a small budget in a row. A reply that does not fit its channel waits for
-// room, and nothing more is read from that channel until it has gone out; others do not notice. Of a service's
-// connections that have not checked in, only so many are kept, and the oldest of the busiest account goes first.
+// A source takes further messages of a channel without another wake-up only while the sender does not wait
+// for answers, and never more than a small budget in a row. A reply that does not fit its channel waits for
+// room, and nothing more is read from that channel until it has gone out; others do not notice. Of a
+// service's connections that have not checked in, only so many are kept, and the oldest of the busiest
+// account goes first.
 class SystemPortSources final : public PortSources {
  public:
   // Both outlive this object and everything it makes.

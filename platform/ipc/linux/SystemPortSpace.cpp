@@ -40,7 +40,8 @@ void SystemPortSpace::eraseIfUnused(PortName name) noexcept {
 KernelReturn SystemPortSpace::allocateReceiveRight(PortName* name) noexcept {
   *name = kNullPort;
   std::array<int, 2> ends{-1, -1};
-  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()) != 0) return kern::resourceShortage;
+  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()) != 0)
+    return kern::resourceShortage;
   UniqueFd receive(ends[0]);
   UniqueFd peer(ends[1]);
   try {
@@ -80,7 +81,7 @@ KernelReturn SystemPortSpace::dropReceiveRight(PortName name) noexcept {
   if (--port.receiveReferences == 0) {
     if (!port.socketFile.empty()) {
       // Another instance may have put its own socket there since: only ours is removed.
-      struct stat status{};
+      struct stat status {};
       if (::lstat(port.socketFile.c_str(), &status) == 0 && status.st_ino == port.socketInode) {
         ::unlink(port.socketFile.c_str());
       }
@@ -111,7 +112,7 @@ PortName SystemPortSpace::adoptService(UniqueFd listening, std::string socketFil
     port->receive = std::move(shared);
     port->receiveReferences = 1;
     port->service = true;
-    struct stat status{};
+    struct stat status {};
     if (!socketFile.empty() && ::lstat(socketFile.c_str(), &status) == 0) port->socketInode = status.st_ino;
     port->socketFile = std::move(socketFile);
     return name;

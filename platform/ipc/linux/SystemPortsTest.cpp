@@ -60,8 +60,9 @@ struct Datagram {
   }
 };
 
-constexpr std::int32_t kEcho = 100;       // complex or not; the reply is a status of the regions' bytes summed up
-constexpr std::int32_t kRegion = 101;     // replies with a region of as many bytes as the request's u32 at 32 says
+constexpr std::int32_t kEcho = 100;  // complex or not; the reply is a status of the regions' bytes summed up
+constexpr std::int32_t kRegion =
+    101;  // replies with a region of as many bytes as the request's u32 at 32 says
 constexpr std::int32_t kKeepRight = 102;  // takes the right over; status 0
 constexpr std::int32_t kRefuse = 103;     // refuses with 5
 constexpr std::int32_t kThrow = 104;      // memory runs out in the routine
@@ -82,7 +83,9 @@ PortDescriptor right() { return {0, 0, 0, kDispositionMoveSend, kPortDescriptorT
 class TestTable final : public RoutineTable {
  public:
   explicit TestTable(SystemRegions& regions) : regions_(regions) {}
-  Handler find(std::int32_t id) const noexcept override { return id >= kEcho && id <= kGiveRight ? &handle : nullptr; }
+  Handler find(std::int32_t id) const noexcept override {
+    return id >= kEcho && id <= kGiveRight ? &handle : nullptr;
+  }
   void* context() const noexcept override { return const_cast<TestTable*>(this); }
 
   int served = 0;
@@ -100,7 +103,8 @@ class TestTable final : public RoutineTable {
     self.arrivedOn = request.localPort();
     self.sizes.push_back(request.size());
     self.trailer = MessageTrailer{};
-    std::memcpy(&self.trailer, &request.trailer(), std::min<std::size_t>(request.trailer().size, sizeof self.trailer));
+    std::memcpy(&self.trailer, &request.trailer(),
+                std::min<std::size_t>(request.trailer().size, sizeof self.trailer));
     if (self.whileServing) self.whileServing();
     std::int32_t sum = 0;
     if (request.isComplex()) {
@@ -139,10 +143,17 @@ class TestTable final : public RoutineTable {
         out.servicePort = {self.given, 0, 0, kDispositionCopySend, kPortDescriptorType};
         return Outcome::accepted;
       }
-      case kKeepRight: reply.setStatus(0); return Outcome::accepted;
-      case kRefuse: reply.setStatus(kern::failure); return Outcome::refused;
-      case kThrow: throw std::bad_alloc();
-      default: reply.setStatus(sum); return Outcome::accepted;
+      case kKeepRight:
+        reply.setStatus(0);
+        return Outcome::accepted;
+      case kRefuse:
+        reply.setStatus(kern::failure);
+        return Outcome::refused;
+      case kThrow:
+        throw std::bad_alloc();
+      default:
+        reply.setStatus(sum);
+        return Outcome::accepted;
     }
     reply.setStatus(kern::resourceShortage);
     return Outcome::refused;
@@ -381,8 +392,12 @@ TEST_F(PortsTest, RegionsTravelAsSealedMemfds) {
 
 TEST_F(PortsTest, BothWaysMayMixAndAnEmptyRegionCarriesNothing) {
   const UniqueFd sealed = memfd("\x05");
-  Datagram datagram =
-      complexMessage(kEcho, 3, 76).add(region(0, 1)).add(region(80, 1)).add(region(0xDEAD, 0)).padTo(80).text("\x07");
+  Datagram datagram = complexMessage(kEcho, 3, 76)
+                          .add(region(0, 1))
+                          .add(region(80, 1))
+                          .add(region(0xDEAD, 0))
+                          .padTo(80)
+                          .text("\x07");
   datagram.fds = {sealed.get()};
   EXPECT_EQ(codeOf(datagram), 12);
 }
@@ -392,7 +407,8 @@ TEST_F(PortsTest, ARegionThatNoCorrectSenderMakesIsRefused) {
     const char* what;
     Datagram datagram;
   };
-  const auto inLine = [](std::uint64_t address, std::uint32_t size, std::uint32_t messageSize, std::size_t length) {
+  const auto inLine = [](std::uint64_t address, std::uint32_t size, std::uint32_t messageSize,
+                         std::size_t length) {
     return complexMessage(kEcho, 1, messageSize).add(region(address, size)).padTo(length);
   };
   std::vector<Case> cases;
@@ -405,11 +421,12 @@ TEST_F(PortsTest, ARegionThatNoCorrectSenderMakesIsRefused) {
   cases.push_back({"the size beyond the datagram", inLine(48, 8, 60, 56)});
   cases.push_back({"the size before the descriptor's end", inLine(40, 8, 40, 48)});
   cases.push_back({"bytes after the last region", inLine(48, 8, 44, 57)});
-  cases.push_back({"out of order",
-                   complexMessage(kEcho, 2, 60).add(region(72, 8)).add(region(64, 8)).padTo(80)});
-  cases.push_back({"overlapping", complexMessage(kEcho, 2, 60).add(region(64, 9)).add(region(72, 8)).padTo(80)});
-  cases.push_back({"the second unaligned",
-                   complexMessage(kEcho, 2, 60).add(region(64, 3)).add(region(67, 3)).padTo(70)});
+  cases.push_back(
+      {"out of order", complexMessage(kEcho, 2, 60).add(region(72, 8)).add(region(64, 8)).padTo(80)});
+  cases.push_back(
+      {"overlapping", complexMessage(kEcho, 2, 60).add(region(64, 9)).add(region(72, 8)).padTo(80)});
+  cases.push_back(
+      {"the second unaligned", complexMessage(kEcho, 2, 60).add(region(64, 3)).add(region(67, 3)).padTo(70)});
   for (const Case& one : cases) EXPECT_EQ(codeOf(one.datagram), -304) << one.what;
   EXPECT_EQ(table.served, 0);
 }
@@ -538,8 +555,9 @@ TEST_F(PortsTest, ARegionThatFitsTheDatagramTravelsInLineAndALargerOneAsASealedM
       EXPECT_EQ(reply.payload.address, 0U);
       ASSERT_EQ(answer->fds.size(), 1U);
       const int seals = ::fcntl(answer->fds[0].get(), F_GET_SEALS);
-      EXPECT_EQ(seals & (F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE), F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE);
-      struct stat status{};
+      EXPECT_EQ(seals & (F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE),
+                F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE);
+      struct stat status {};
       ::fstat(answer->fds[0].get(), &status);
       EXPECT_EQ(status.st_size, length);
     }
@@ -718,7 +736,7 @@ class ServiceTest : public PortsTest {
 TEST_F(ServiceTest, TheSocketFileIsMadeForEverybodyAndGoesWithTheRight) {
   directory += "/a/b";
   listen();
-  struct stat status{};
+  struct stat status {};
   ASSERT_EQ(::stat(path().c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 07777, 0666U);
   serviceSource->invalidate();

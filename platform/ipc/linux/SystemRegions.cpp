@@ -50,14 +50,16 @@ void SystemRegions::deallocate(void* address, std::size_t length) noexcept {
 }
 
 UniqueFd SystemRegions::sealIntoDescriptor(void* address, std::size_t length) noexcept {
-  const auto region = std::find_if(large_.begin(), large_.end(),
-                                   [address](const Large& candidate) { return candidate.address == address; });
+  const auto region = std::find_if(large_.begin(), large_.end(), [address](const Large& candidate) {
+    return candidate.address == address;
+  });
   if (region == large_.end()) return {};
   UniqueFd memfd = std::move(region->memfd);
   large_.erase(region);
   // The seal against writing is refused while a writable mapping stands.
   ::munmap(address, length);
-  if (::fcntl(memfd.get(), F_ADD_SEALS, F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE | F_SEAL_SEAL) != 0) return {};
+  if (::fcntl(memfd.get(), F_ADD_SEALS, F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE | F_SEAL_SEAL) != 0)
+    return {};
   return memfd;
 }
 

@@ -11,8 +11,9 @@
 
 namespace brenvik {
 
-// Regions for replies. One that fits a datagram beside its message is plain memory (the last one freed is kept
-// for the next); a larger one is written straight into a memfd (memfd_create(2)) that will travel as it is.
+// Regions for replies. One that fits a datagram beside its message is plain memory (the last one freed is
+// kept for the next); a larger one is written straight into a memfd (memfd_create(2)) that will travel as it
+// is.
 class SystemRegions final : public RegionAllocator {
  public:
   // Longest region that travels in the same datagram as an out-of-line reply, in bytes.
@@ -22,7 +23,8 @@ class SystemRegions final : public RegionAllocator {
   void deallocate(void* address, std::size_t length) noexcept override;
 
   // For a region longer than kLongestInLine: takes its mapping away and returns its memfd, sealed against
-  // shrinking, growing and writing. An invalid descriptor when the kernel refused; the region is gone either way.
+  // shrinking, growing and writing. An invalid descriptor when the kernel refused; the region is gone either
+  // way.
   UniqueFd sealIntoDescriptor(void* address, std::size_t length) noexcept;
 
   std::size_t live() const noexcept { return liveSmall_ + large_.size(); }

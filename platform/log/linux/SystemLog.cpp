@@ -73,7 +73,7 @@ class Field {
 
 // Asked anew for each line, because the journal may start after the daemon; a stat costs less than the line.
 bool journalIsThere() noexcept {
-  struct stat status{};
+  struct stat status {};
   return ::stat(kJournalSocket, &status) == 0 && S_ISSOCK(status.st_mode);
 }
 
@@ -97,11 +97,13 @@ void SystemLog::unified(LogLevel level, std::string_view line, const LogPlace& p
     const Field file("CODE_FILE", place.file);
     const Field codeLine("CODE_LINE", {number.data(), static_cast<std::size_t>(digits)});
     const Field function("CODE_FUNC", place.function);
-    const std::array fields{message.io(), priority.io(), identifier.io(), file.io(), codeLine.io(), function.io()};
+    const std::array fields{message.io(), priority.io(), identifier.io(),
+                            file.io(),    codeLine.io(), function.io()};
     if (::sd_journal_sendv(fields.data(), static_cast<int>(fields.size())) >= 0) return;
   }
   std::array<char, 8200> text;
-  const int size = std::snprintf(text.data(), text.size(), "<%d>%s\n", static_cast<int>(level), escaped.text());
+  const int size =
+      std::snprintf(text.data(), text.size(), "<%d>%s\n", static_cast<int>(level), escaped.text());
   // One write a line, so that lines of several threads do not mix; there is nobody to tell when it fails.
   (void)!::write(STDERR_FILENO, text.data(), static_cast<std::size_t>(size));
 }

@@ -113,7 +113,10 @@ class ManualWorkQueue::ManualTimer final : public WorkQueue::Timer {
  public:
   ManualTimer(ManualWorkQueue& queue, std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
               Task handler)
-      : queue_(queue), first_(first), interval_(interval), handler_(std::make_shared<Task>(std::move(handler))) {}
+      : queue_(queue),
+        first_(first),
+        interval_(interval),
+        handler_(std::make_shared<Task>(std::move(handler))) {}
   ~ManualTimer() override { cancel(); }
   void activate() override {
     if (active_) return;
@@ -156,7 +159,8 @@ inline std::unique_ptr<WorkQueue::Timer> ManualWorkQueue::makeTimer(std::chrono:
 // Makes manual queues, keeps the serial ones it made for the test to run, and watches invented processes.
 class ManualWorkQueues final : public WorkQueues {
  public:
-  explicit ManualWorkQueues(ManualClock& clock) : clock_(clock), main_(clock, "main"), global_(clock, "global") {}
+  explicit ManualWorkQueues(ManualClock& clock)
+      : clock_(clock), main_(clock, "main"), global_(clock, "global") {}
 
   ManualWorkQueue& main() noexcept override { return main_; }
   ManualWorkQueue& global() noexcept override { return global_; }
@@ -187,7 +191,8 @@ class ManualWorkQueues final : public WorkQueues {
 
 class ManualWorkQueues::ManualProcessExitSource final : public ProcessExitSource {
  public:
-  ManualProcessExitSource(ManualWorkQueues& queues, pid_t pid, WorkQueue::Task onExit, WorkQueue::Task onCancel)
+  ManualProcessExitSource(ManualWorkQueues& queues, pid_t pid, WorkQueue::Task onExit,
+                          WorkQueue::Task onCancel)
       : queues_(queues), pid_(pid), onExit_(std::move(onExit)), onCancel_(std::move(onCancel)) {}
   ~ManualProcessExitSource() override { forget(); }
   void activate() override { queues_.watched_.emplace(pid_, this); }
@@ -236,7 +241,8 @@ class ManualRunLoop final : public RunLoop {
     ++stops;
     stopped_ = true;
   }
-  std::unique_ptr<DescriptorSource> addDescriptor(int fd, std::uint32_t events, DescriptorHandler handler) override;
+  std::unique_ptr<DescriptorSource> addDescriptor(int fd, std::uint32_t events,
+                                                  DescriptorHandler handler) override;
   std::unique_ptr<LoopSource> addTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
                                        std::function<void()> handler, std::function<void()> failed) override;
 
@@ -293,7 +299,9 @@ class ManualRunLoop::ManualTimer final : public LoopSource {
  public:
   ManualTimer(ManualRunLoop& loop, std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
               std::function<void()> handler)
-      : loop_(loop), interval_(interval), handler_(std::make_shared<std::function<void()>>(std::move(handler))) {
+      : loop_(loop),
+        interval_(interval),
+        handler_(std::make_shared<std::function<void()>>(std::move(handler))) {
     ++loop_.timers_;
     arm(first);
   }
@@ -328,7 +336,8 @@ inline std::unique_ptr<DescriptorSource> ManualRunLoop::addDescriptor(int fd, st
 
 inline std::unique_ptr<LoopSource> ManualRunLoop::addTimer(std::chrono::nanoseconds first,
                                                            std::chrono::nanoseconds interval,
-                                                           std::function<void()> handler, std::function<void()>) {
+                                                           std::function<void()> handler,
+                                                           std::function<void()>) {
   if (refuseTimers) return nullptr;
   return std::make_unique<ManualTimer>(*this, first, interval, std::move(handler));
 }

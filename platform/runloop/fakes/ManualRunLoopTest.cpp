@@ -47,13 +47,12 @@ TEST(ManualRunLoopTest, TimerCanBeDestroyedByItsOwnHandler) {
   ManualRunLoop loop(clock);
   std::unique_ptr<LoopSource> timer;
   int fired = 0;
-  timer = loop.addTimer(
-      10s, 10s,
-      [&] {
-        ++fired;
-        timer.reset();
-      },
-      {});
+  timer = loop.addTimer(10s, 10s,
+                        [&] {
+                          ++fired;
+                          timer.reset();
+                        },
+                        {});
   clock.advance(60s);
   EXPECT_EQ(fired, 1);
   EXPECT_EQ(loop.timers(), 0U);

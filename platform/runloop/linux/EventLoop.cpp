@@ -23,7 +23,8 @@ constexpr clockid_t kClock = CLOCK_BOOTTIME;
 std::uint64_t nowMicroseconds() noexcept {
   timespec now{};
   ::clock_gettime(kClock, &now);
-  return static_cast<std::uint64_t>(now.tv_sec) * 1'000'000U + static_cast<std::uint64_t>(now.tv_nsec) / 1'000U;
+  return static_cast<std::uint64_t>(now.tv_sec) * 1'000'000U +
+         static_cast<std::uint64_t>(now.tv_nsec) / 1'000U;
 }
 
 // Rounded up, so that nothing fires early.
@@ -200,9 +201,10 @@ void EventLoop::disarm(Timer& timer) noexcept {
   armed_.erase(&timer);
 }
 
-std::unique_ptr<LoopSource> EventLoop::addTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
-                                                std::chrono::nanoseconds leeway, std::function<void()> handler,
-                                                std::function<void()> failed) {
+std::unique_ptr<LoopSource> EventLoop::addTimer(std::chrono::nanoseconds first,
+                                                std::chrono::nanoseconds interval,
+                                                std::chrono::nanoseconds leeway,
+                                                std::function<void()> handler, std::function<void()> failed) {
   auto timer = std::make_shared<Timer>();
   timer->loop = this;
   timer->next = nowMicroseconds() + toMicroseconds(first);

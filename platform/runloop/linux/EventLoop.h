@@ -21,7 +21,8 @@ namespace brenvik {
 // One thread's sd_event(3) loop with an inbox that any thread may post to; what the main run loop and every
 // work queue stand on. It wakes for its sources and its inbox and for nothing else.
 //
-// The thread that calls runOnce() is the loop's thread; before the first call, the thread that made the loop is.
+// The thread that calls runOnce() is the loop's thread; before the first call, the thread that made the loop
+// is.
 class EventLoop : public std::enable_shared_from_this<EventLoop> {
  public:
   // Null when the system is out of descriptors or memory.
@@ -41,7 +42,8 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   bool onLoopThread() const noexcept;
 
   // Loop thread only.
-  std::unique_ptr<DescriptorSource> addDescriptor(int fd, std::uint32_t events, RunLoop::DescriptorHandler handler);
+  std::unique_ptr<DescriptorSource> addDescriptor(int fd, std::uint32_t events,
+                                                  RunLoop::DescriptorHandler handler);
 
   // A timer that may be made, armed and destroyed on any thread. `failed` runs on the loop's thread when it
   // could not be armed there. Null when it could not be made at once.

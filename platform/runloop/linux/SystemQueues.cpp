@@ -37,9 +37,13 @@ void applyQualityOfService(QualityOfService qualityOfService) noexcept {
 // A timer that is armed when it is activated; shared by the main queue and the queues with threads.
 class QueueTimer final : public WorkQueue::Timer {
  public:
-  QueueTimer(std::shared_ptr<EventLoop> loop, std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
-             std::chrono::nanoseconds leeway, WorkQueue::Task handler)
-      : loop_(std::move(loop)), first_(first), interval_(interval), leeway_(leeway), handler_(std::move(handler)) {}
+  QueueTimer(std::shared_ptr<EventLoop> loop, std::chrono::nanoseconds first,
+             std::chrono::nanoseconds interval, std::chrono::nanoseconds leeway, WorkQueue::Task handler)
+      : loop_(std::move(loop)),
+        first_(first),
+        interval_(interval),
+        leeway_(leeway),
+        handler_(std::move(handler)) {}
   void activate() override {
     if (source_ != nullptr) return;
     source_ = loop_->addTimer(first_, interval_, leeway_, handler_, {});
@@ -57,7 +61,8 @@ class QueueTimer final : public WorkQueue::Timer {
 
 class SystemQueue : public WorkQueue {
  public:
-  SystemQueue(std::shared_ptr<EventLoop> loop, std::string label) : loop_(std::move(loop)), label_(std::move(label)) {}
+  SystemQueue(std::shared_ptr<EventLoop> loop, std::string label)
+      : loop_(std::move(loop)), label_(std::move(label)) {}
 
   const std::string& label() const noexcept override { return label_; }
   void post(Task task) override {
@@ -129,7 +134,8 @@ class ThreadQueue final : public SystemQueue {
 
 class PidfdExitSource final : public ProcessExitSource {
  public:
-  PidfdExitSource(std::weak_ptr<WorkQueue> queue, UniqueFd pidfd, WorkQueue::Task onExit, WorkQueue::Task onCancel)
+  PidfdExitSource(std::weak_ptr<WorkQueue> queue, UniqueFd pidfd, WorkQueue::Task onExit,
+                  WorkQueue::Task onCancel)
       : queue_(std::move(queue)), state_(std::make_shared<State>()) {
     state_->pidfd = std::move(pidfd);
     state_->onExit = std::move(onExit);
@@ -218,9 +224,12 @@ std::unique_ptr<DescriptorSource> SystemRunLoop::addDescriptor(int fd, std::uint
   return loop_->addDescriptor(fd, events, std::move(handler));
 }
 
-std::unique_ptr<LoopSource> SystemRunLoop::addTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
-                                                    std::function<void()> handler, std::function<void()> failed) {
-  return loop_->addTimer(first, interval, std::chrono::nanoseconds::zero(), std::move(handler), std::move(failed));
+std::unique_ptr<LoopSource> SystemRunLoop::addTimer(std::chrono::nanoseconds first,
+                                                    std::chrono::nanoseconds interval,
+                                                    std::function<void()> handler,
+                                                    std::function<void()> failed) {
+  return loop_->addTimer(first, interval, std::chrono::nanoseconds::zero(), std::move(handler),
+                         std::move(failed));
 }
 
 SystemQueues::SystemQueues(SystemRunLoop& mainLoop)

@@ -2,8 +2,8 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/runloop/linux/SystemQueues.h"
 
-#include <gtest/gtest.h>
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <sys/epoll.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
@@ -67,12 +67,11 @@ TEST_F(SystemQueuesTest, TimeOutEndsARunThatHasNothingToDo) {
 TEST_F(SystemQueuesTest, RepeatingTimerFiresUntilItsHandlerDestroysIt) {
   int fired = 0;
   std::unique_ptr<LoopSource> timer;
-  timer = loop->addTimer(
-      1ms, 1ms,
-      [&] {
-        if (++fired == 3) timer.reset();
-      },
-      {});
+  timer = loop->addTimer(1ms, 1ms,
+                         [&] {
+                           if (++fired == 3) timer.reset();
+                         },
+                         {});
   runUntil([&] { return fired == 3; });
   EXPECT_EQ(loop->run(20ms, ReturnAfterSource::no), RunResult::timedOut);
   EXPECT_EQ(fired, 3);
@@ -223,8 +222,8 @@ TEST_F(ProcessExitTest, TellsOnceThatTheProcessHasExited) {
   SystemQueues queues(*loop);
   auto [pid, life] = child();
   std::promise<bool> told;
-  const auto source = queues.makeProcessExitSource(
-      pid, processStartTime(pid).value(), [&] { told.set_value(queues.global().isCurrent()); }, {});
+  const auto source = queues.makeProcessExitSource(pid, processStartTime(pid).value(),
+                                                   [&] { told.set_value(queues.global().isCurrent()); }, {});
   ASSERT_NE(source, nullptr);
   source->activate();
   life.reset();

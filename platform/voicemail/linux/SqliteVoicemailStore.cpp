@@ -105,7 +105,8 @@ class SqliteVoicemailStore::Database {
 bool SqliteVoicemailStore::makePlace(std::string* file, IfMissing ifMissing) {
   const Account account = account_();
   if (account.home.empty()) return false;
-  const std::unique_ptr<char, decltype(&std::free)> home(::realpath(account.home.c_str(), nullptr), &std::free);
+  const std::unique_ptr<char, decltype(&std::free)> home(::realpath(account.home.c_str(), nullptr),
+                                                         &std::free);
   if (!home) return false;
   const bool create = ifMissing == IfMissing::create;
   const UniqueFd top(::open(home.get(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
