@@ -288,7 +288,13 @@ class Failures(UpdateTest):
         thread = threading.Thread(target=serve)
         thread.start()
         self.addCleanup(thread.join)
-        self.assert_check_fails("connection lost", 200, "OK")
+        self.assertEqual(self.check(), ["UpdateFailed"])
+        # A reset throws away what the client has not read yet, so it may or may not have seen the status.
+        expected = [("unified", ERROR, self.failure(MANIFEST, "connection lost", *seen))
+                    for seen in ((200, "OK"), (0, "no status"))]
+        eventually(lambda: any(line in self.logs.lines for line in expected), what="one of the two lines")
+        self.logs.wait_for("unified", ERROR, f"Could not fetch data from source {MANIFEST}")
+        self.assertFalse(DIRECTORY.exists())
 
 
 class Stalls(UpdateTest):

@@ -7,7 +7,7 @@ import plistlib
 import struct
 
 import wire
-from harness import ERROR, INFO, LOG_ERR, HelperTest, main
+from harness import ERROR, INFO, LOG_ERR, HelperTest, eventually, main
 
 PREFERENCES = pathlib.Path("/root/Library/Preferences")
 DOMAIN = "com.example.test"
@@ -135,7 +135,7 @@ class Preferences(HelperTest):
         for domain in ("", ".", "..", "../escape", "a/b"):
             self.logs.clear()
             self.assertEqual(client.set_preference(domain, "key", plistlib.dumps(1)), 0)
-            self.assertTrue(any(level == ERROR for channel, level, _ in self.logs.lines if channel == "unified"))
+            eventually(lambda: any(line[:2] == ("unified", ERROR) for line in self.logs.lines), what="an error line")
             self.assertEqual(client.copy_preference(domain, "key"), b"")
         self.assertFalse(pathlib.Path("/root/Library/escape.plist").exists())
 
@@ -146,7 +146,8 @@ class Preferences(HelperTest):
         self.assertEqual(client.set_preference("com.example.damaged", "key", plistlib.dumps(1)), 0)
         aside = [path for path in PREFERENCES.iterdir() if path.read_bytes() == b"bplist00 half a file"]
         self.assertEqual(len(aside), 1, list(PREFERENCES.iterdir()))
-        self.assertTrue(any(aside[0].name in text for _, level, text in self.logs.lines if level == ERROR))
+        eventually(lambda: any(aside[0].name in text for _, level, text in self.logs.lines if level == ERROR),
+                   what="an error line that says where it went")
 
     def test_another_writers_value_is_seen(self):
         client = self.client()
