@@ -65,7 +65,7 @@ int FileSystemManager::copyOrMove(Mode mode, const std::string& source, const st
   if (::stat(source.c_str(), &info) != 0) return kPosixFailure;
   bool destinationIsDirectory = false;
   if (!files().itemExists(destination, &destinationIsDirectory)) {
-    (void)::chown(source.c_str(), uid, gid);  // an item that cannot be given away is still transferred
+    (void)!::chown(source.c_str(), uid, gid);  // an item that cannot be given away is still transferred
     return transfer(mode, source, destination, IfPresent::fail).codeOr(kUnexplained);
   }
   if (!destinationIsDirectory && S_ISDIR(info.st_mode)) return EEXIST;
@@ -78,7 +78,7 @@ int FileSystemManager::copyOrMove(Mode mode, const std::string& source, const st
     bool isDirectoryThere = false;
     gives = files().itemExists(effective, &isDirectoryThere) && !isDirectoryThere;
   }
-  (void)::chown(source.c_str(), uid, gid);
+  (void)!::chown(source.c_str(), uid, gid);
   merge(mode, source, effective, gives ? IfPresent::replaceNonDirectory : IfPresent::fail);
   return 0;
 }
