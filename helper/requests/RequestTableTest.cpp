@@ -171,7 +171,7 @@ TEST_F(RequestTableTest, RepliesHaveTheFormOfTheirRow) {
       const auto& reply = *reinterpret_cast<const OutOfLineReply*>(answer);
       EXPECT_EQ(reply.header.bits, kComplexBit | kReplyDisposition);
       EXPECT_EQ(reply.descriptorCount, 1U);
-      EXPECT_EQ(reply.payload.address, reinterpret_cast<std::uint64_t>(routines.region));
+      EXPECT_EQ(std::uint64_t{reply.payload.address}, reinterpret_cast<std::uint64_t>(routines.region));
       EXPECT_EQ(reply.payload.deallocate, 1);
       EXPECT_EQ(reply.payload.copy, 1);
       EXPECT_EQ(reply.payload.pad, 0);
@@ -280,7 +280,7 @@ TEST_F(RequestTableTest, AnEmptyPayloadIsSuccessWithAddressAndLengthZero) {
   ASSERT_EQ(deliver(kRequestRoutines[7]), kern::success);
   const auto& reply = *reinterpret_cast<const OutOfLineReply*>(answer);
   EXPECT_EQ(reply.header.size, 56U);
-  EXPECT_EQ(reply.payload.address, 0U);
+  EXPECT_EQ(std::uint64_t{reply.payload.address}, 0U);
   EXPECT_EQ(reply.payload.size, 0U);
   EXPECT_EQ(reply.byteCount, 0U);
 }

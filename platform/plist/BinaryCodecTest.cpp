@@ -9,6 +9,7 @@
 #include <cmath>
 #include <ctime>
 #include <functional>
+#include <limits>
 
 #include "platform/plist/PropertyListCodec.h"
 
@@ -328,9 +329,9 @@ TEST(BinaryReaderTest, ASharedExpansionIsMeasuredToTheByte) {
   // One of everything, many times over, and a text that fills the form up to its last byte.
   const PropertyList everything = PropertyList::array(
       {PropertyList::integer(-12345), PropertyList::unsignedInteger(UINT64_MAX), PropertyList::real(-0.1),
-       PropertyList::real(NAN), PropertyList::date(-1e9), PropertyList::boolean(true),
-       PropertyList::boolean(false), PropertyList::string("<&>\r\n"), bytes(std::string(58, 'x')), bytes(""),
-       PropertyList::array({}), PropertyList::dictionary({}),
+       PropertyList::real(std::numeric_limits<double>::quiet_NaN()), PropertyList::date(-1e9),
+       PropertyList::boolean(true), PropertyList::boolean(false), PropertyList::string("<&>\r\n"),
+       bytes(std::string(58, 'x')), bytes(""), PropertyList::array({}), PropertyList::dictionary({}),
        PropertyList::dictionary(
            {{"a&b", PropertyList::array({PropertyList::dictionary({{"k", bytes("abc")}})})}})});
   auto document = [&](std::size_t copies, std::size_t filling) {

@@ -30,7 +30,7 @@ std::vector<std::string> keysOf(const PropertyList& dictionary) {
 }
 
 TEST(PropertyListTest, IsNoValueUntilItIsMade) {
-  const PropertyList none;
+  const PropertyList none{};
   EXPECT_FALSE(none);
   EXPECT_FALSE(none.is(Type::string));
   EXPECT_EQ(none.size(), 0u);

@@ -20,6 +20,9 @@ std::string writtenAsXml(const PropertyList& value) {
   return serializePropertyList(value, PropertyListFormat::xml).value_or("(refused)");
 }
 
+constexpr double kInfinity = std::numeric_limits<double>::infinity();
+constexpr double kNan = std::numeric_limits<double>::quiet_NaN();
+
 constexpr std::string_view kHead =
     "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
     "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
@@ -110,11 +113,11 @@ TEST(XmlWriterTest, RefusesCharactersThatXmlCannotCarry) {
 
 TEST(XmlWriterTest, RealsAreShortestAndComeBackAsTheyWere) {
   EXPECT_EQ(writtenAsXml(PropertyList::real(0.1)), framed("<real>0.1</real>\n"));
-  EXPECT_EQ(writtenAsXml(PropertyList::real(-double{INFINITY})), framed("<real>-inf</real>\n"));
+  EXPECT_EQ(writtenAsXml(PropertyList::real(-kInfinity)), framed("<real>-inf</real>\n"));
   EXPECT_EQ(writtenAsXml(PropertyList::real(-std::numeric_limits<double>::quiet_NaN())),
             framed("<real>nan</real>\n"));
   for (const double number :
-       {5e-324, 1.7976931348623157e308, -0.0, 1.0 / 3, 1e23, 123456789012345680.0, double{INFINITY}}) {
+       {5e-324, 1.7976931348623157e308, -0.0, 1.0 / 3, 1e23, 123456789012345680.0, kInfinity}) {
     const PropertyList again = parse(writtenAsXml(PropertyList::real(number)));
     EXPECT_EQ(again.asReal(), number);
     EXPECT_EQ(std::signbit(again.asReal().value()), std::signbit(number));
@@ -128,8 +131,7 @@ TEST(XmlWriterTest, DatesKeepTheSecondThatHasBegunAndTheYearsOfTheForm) {
   EXPECT_EQ(dateText(-978307200), framed("<date>1970-01-01T00:00:00Z</date>\n"));
   EXPECT_EQ(dateText(-63113904000.0), framed("<date>0001-01-01T00:00:00Z</date>\n"));
   EXPECT_EQ(dateText(252423993599.0), framed("<date>9999-12-31T23:59:59Z</date>\n"));
-  for (const double bad :
-       {-63113904000.5, 252423993600.0, 1e300, double{INFINITY}, double{-INFINITY}, double{NAN}}) {
+  for (const double bad : {-63113904000.5, 252423993600.0, 1e300, kInfinity, -kInfinity, kNan}) {
     EXPECT_EQ(dateText(bad), "(refused)") << bad;
   }
 }

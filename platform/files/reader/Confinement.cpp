@@ -37,8 +37,8 @@ bool filterSystemCalls() {
   bool good = true;
   for (const int call : kAllowed) good = good && ::seccomp_rule_add(filter, SCMP_ACT_ALLOW, call, 0) == 0;
   // fstat(2) of newer C libraries; only ever of an open descriptor.
-  good = good && ::seccomp_rule_add(filter, SCMP_ACT_ALLOW, SCMP_SYS(newfstatat), 1,
-                                    SCMP_A3(SCMP_CMP_MASKED_EQ, AT_EMPTY_PATH, AT_EMPTY_PATH)) == 0;
+  const scmp_arg_cmp emptyPath{3, SCMP_CMP_MASKED_EQ, AT_EMPTY_PATH, AT_EMPTY_PATH};
+  good = good && ::seccomp_rule_add_array(filter, SCMP_ACT_ALLOW, SCMP_SYS(newfstatat), 1, &emptyPath) == 0;
   // The one that is refused instead of ending the process: it shows that the filter is in force.
   good = good && ::seccomp_rule_add(filter, SCMP_ACT_ERRNO(EUCLEAN), SCMP_SYS(getppid), 0) == 0;
   good = good && ::seccomp_load(filter) == 0;

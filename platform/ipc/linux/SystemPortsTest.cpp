@@ -12,6 +12,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cstdlib>
 #include <cstring>
@@ -126,7 +127,7 @@ class TestTable final : public RoutineTable {
         const auto length = request.at<std::uint32_t>(32);
         void* address = nullptr;
         if (self.regions_.allocate(&address, length) != kern::success) break;
-        std::memset(address, 'r', length);
+        std::fill_n(static_cast<char*>(address), length, 'r');
         auto& out = reply.as<OutOfLineReply>();
         out.header.bits = kReplyDisposition | kComplexBit;
         out.header.size = sizeof out;
@@ -547,12 +548,12 @@ TEST_F(PortsTest, ARegionThatFitsTheDatagramTravelsInLineAndALargerOneAsASealedM
     EXPECT_EQ(reply.header.size, 56U);
     EXPECT_EQ(reply.payload.size, length);
     if (length <= 65480) {
-      EXPECT_EQ(reply.payload.address, 56U);
+      EXPECT_EQ(std::uint64_t{reply.payload.address}, 56U);
       EXPECT_EQ(answer->bytes.size(), 56 + length);
       EXPECT_EQ(answer->bytes.back(), std::byte{'r'});
       EXPECT_TRUE(answer->fds.empty());
     } else {
-      EXPECT_EQ(reply.payload.address, 0U);
+      EXPECT_EQ(std::uint64_t{reply.payload.address}, 0U);
       ASSERT_EQ(answer->fds.size(), 1U);
       const int seals = ::fcntl(answer->fds[0].get(), F_GET_SEALS);
       EXPECT_EQ(seals & (F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE),
@@ -569,7 +570,8 @@ TEST_F(PortsTest, AnEmptyRegionHasAddressAndSizeZero) {
   const auto answer = exchange(message(kRegion).add(kNdrRecord).add(0U));
   ASSERT_TRUE(answer);
   EXPECT_EQ(answer->bytes.size(), 56U);
-  EXPECT_EQ(reinterpret_cast<const OutOfLineReply*>(answer->bytes.data())->payload.address, 0U);
+  EXPECT_EQ(std::uint64_t{reinterpret_cast<const OutOfLineReply*>(answer->bytes.data())->payload.address},
+            0U);
 }
 
 TEST_F(PortsTest, AFullChannelDelaysItsOwnRepliesOnlyAndIsNotReadUntilTheyHaveGoneOut) {

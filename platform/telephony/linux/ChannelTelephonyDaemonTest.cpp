@@ -136,7 +136,7 @@ TEST_F(ChannelTelephonyDaemonTest, CivicInfoTravelsAsOneComplexMessageWithItsReg
   EXPECT_EQ(message.header.voucher, 0U);
   EXPECT_EQ(message.header.id, 9100001);
   EXPECT_EQ(message.descriptorCount, 1U);
-  EXPECT_EQ(message.values.address, 56U);
+  EXPECT_EQ(std::uint64_t{message.values.address}, 56U);
   EXPECT_EQ(message.values.type, 1U);
   EXPECT_EQ(message.values.size, request.datagram.size() - 56);
   EXPECT_EQ(std::memcmp(&message.ndr, &kNdrRecord, 8), 0);
