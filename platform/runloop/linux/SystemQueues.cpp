@@ -45,10 +45,14 @@ class QueueTimer final : public WorkQueue::Timer {
         leeway_(leeway),
         handler_(std::move(handler)) {}
   void activate() override {
+    const std::lock_guard hold(lock_);
     if (source_ != nullptr) return;
     source_ = loop_->addTimer(first_, interval_, leeway_, handler_, {});
   }
-  void cancel() noexcept override { source_.reset(); }
+  void cancel() noexcept override {
+    const std::lock_guard hold(lock_);
+    source_.reset();
+  }
 
  private:
   const std::shared_ptr<EventLoop> loop_;
@@ -56,6 +60,7 @@ class QueueTimer final : public WorkQueue::Timer {
   const std::chrono::nanoseconds interval_;
   const std::chrono::nanoseconds leeway_;
   const WorkQueue::Task handler_;
+  std::mutex lock_;  // the first firing may cancel before activate() has returned on its thread
   std::unique_ptr<LoopSource> source_;
 };
 
