@@ -11,6 +11,7 @@
 
 #include <cerrno>
 #include <cmath>
+#include <mutex>
 #include <thread>
 #include <utility>
 
