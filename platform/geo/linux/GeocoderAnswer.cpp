@@ -30,12 +30,19 @@ class Reader final : public nlohmann::json_sax<nlohmann::json> {
   bool key(string_t& name) override {
     if (depth_ == 1) {
       inAddress_ = name == "address";
+      if (inAddress_) {
+        parts_ = {};
+        address_ = false;
+      }
       if (name == "error") error_ = true;
     }
     part_ = nullptr;
     if (depth_ == 2 && inAddress_) {
       const auto* const found = std::find(kParts.begin(), kParts.end(), name);
-      if (found != kParts.end()) part_ = &parts_[static_cast<std::size_t>(found - kParts.begin())];
+      if (found != kParts.end()) {
+        part_ = &parts_[static_cast<std::size_t>(found - kParts.begin())];
+        part_->reset();
+      }
     }
     return true;
   }

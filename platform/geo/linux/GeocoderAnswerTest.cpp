@@ -90,6 +90,9 @@ TEST(GeocoderAnswerTest, PartsThatAreNoUsableTextAreAbsent) {
 
 TEST(GeocoderAnswerTest, OfAKeyGivenTwiceTheLastCounts) {
   EXPECT_EQ(addressIn(R"({"address":{"city":"A","city":"B"}})").locality, "B");
+  EXPECT_EQ(addressIn(R"({"address":{"city":"A","city":null}})").locality, std::nullopt);
+  EXPECT_EQ(addressIn(R"({"address":{"city":"A"},"address":{"state":"S"}})").locality, std::nullopt);
+  EXPECT_EQ(problemIn(R"({"address":{"city":"A"},"address":"S"})"), "the geocoder's answer has no address");
 }
 
 TEST(GeocoderAnswerTest, WhatIsNotAJsonObjectIsAnError) {
