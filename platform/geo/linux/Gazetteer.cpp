@@ -137,7 +137,7 @@ bool Gazetteer::open(std::string& error) {
 Gazetteer::Answer Gazetteer::lookUp(Coordinate coordinate) {
   std::string error;
   if (!open(error)) return {{}, GeoError{"the offline gazetteer cannot be read: " + error}};
-  failed_ = false;
+  failure_.reset();
   const Position position{std::llround(coordinate.longitude * kUnitsPerDegree),
                           std::llround(coordinate.latitude * kUnitsPerDegree)};
 
@@ -154,11 +154,15 @@ Gazetteer::Answer Gazetteer::lookUp(Coordinate coordinate) {
     if (place && place->kilometres <= kCityReach) address.locality = std::move(place->name);
     answer.address = std::move(address);
   }
-  if (failed_)
-    return {{},
-            GeoError{std::string("the offline gazetteer is damaged: ") +
-                     sqlite()->errmsg(opened_->database.get())}};
+  if (failure_) return {{}, GeoError{"the offline gazetteer is damaged: " + *failure_}};
   return answer;
+}
+
+void Gazetteer::finish(Query& statement, int code) {
+  // The text is that of the latest call, whatever it came to.
+  if (code != SQLITE_ROW && code != SQLITE_DONE && !failure_)
+    failure_ = sqlite()->errmsg(opened_->database.get());
+  statement.reset();
 }
 
 // Borders meet the antimeridian from one side or the other, and the pole from one: a position on the edge of
@@ -182,8 +186,7 @@ std::optional<std::string> Gazetteer::countryAt(Position position) {
     inside = !inside;
     country = opened_->rings.text(1);
   }
-  opened_->rings.reset();
-  if (code != SQLITE_DONE) failed_ = true;
+  finish(opened_->rings, code);
   for (auto& [id, region] : regions) {
     if (region.first) return std::move(region.second);
   }
@@ -242,15 +245,15 @@ void Gazetteer::searchBox(Position position, const std::string* country, std::in
     nearest = Place{kilometres, std::string(statement.text(2)), std::string(statement.text(3)), {}};
     if (!statement.isNull(4)) nearest->area = statement.integer(4);
   }
-  statement.reset();
-  if (code != SQLITE_DONE) failed_ = true;
+  finish(statement, code);
 }
 
 std::optional<std::string> Gazetteer::areaName(std::int64_t area) {
   opened_->area.bind(1, area);
   std::optional<std::string> name;
-  if (opened_->area.step() == SQLITE_ROW) name = opened_->area.text(0);
-  opened_->area.reset();
+  const int code = opened_->area.step();
+  if (code == SQLITE_ROW) name = opened_->area.text(0);
+  finish(opened_->area, code);
   return name;
 }
 

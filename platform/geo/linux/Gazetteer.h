@@ -40,6 +40,8 @@ class Gazetteer {
   };
 
   bool open(std::string& error);
+  // Ends a run of a statement, whose last step gave `code`.
+  void finish(Query& statement, int code);
   std::optional<std::string> countryAt(Position position);
   std::optional<std::string> countryAround(Position position);
   // The nearest place within `kilometres`, of the country if one is named.
@@ -58,7 +60,7 @@ class Gazetteer {
     Query area;
   };
   std::optional<Opened> opened_;
-  bool failed_ = false;  // a statement of this look-up met an error
+  std::optional<std::string> failure_;  // the first error that a statement of this look-up met
 };
 
 }  // namespace brenvik

@@ -180,6 +180,21 @@ TEST_F(GazetteerFileTest, ADamagedDatabaseIsAnErrorOrAnAnswerAndNeverACrash) {
   EXPECT_EQ(answer.error->description.rfind("the offline gazetteer ", 0), 0U);
 }
 
+TEST_F(GazetteerFileTest, AnErrorOfTheLastStatementIsOneOfTheLookUpToo) {
+  const auto path = folder / "failing.db";
+  makeDatabase(path,
+               "pragma application_id = 1115047777; pragma user_version = 1;"
+               "create view area as select 1 as id, abs(-9223372036854775807 - 1) as name;"
+               "create table place(id integer primary key, name, area, country, border);"
+               "create virtual table place_at using rtree_i32(id, min_lng, max_lng, min_lat, max_lat);"
+               "create table region(id integer primary key, country);"
+               "create table ring(id integer primary key, region, points);"
+               "create virtual table ring_at using rtree_i32(id, min_lng, max_lng, min_lat, max_lat);"
+               "insert into place values(1, 'Oslo', 1, 'NO', null);"
+               "insert into place_at values(1, 1070000, 1070000, 5990000, 5990000);");
+  EXPECT_EQ(problemOf(path), "the offline gazetteer is damaged: integer overflow");
+}
+
 TEST_F(GazetteerFileTest, TheDatabaseIsSmallerThan24Megabytes) {
   EXPECT_LT(std::filesystem::file_size(GAZETTEER_DATABASE), 24'000'000U);
 }
