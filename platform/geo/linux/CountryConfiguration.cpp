@@ -99,7 +99,13 @@ void CountryConfiguration::refreshConfiguration() {
   if (identity_ == identityOf(status)) return;
   identity_ = identityOf(status);
   configured_.reset();
+  errno = 0;
   const auto content = readFile(files_.configuration, &status);
+  if (!content && (errno == EMFILE || errno == ENFILE || errno == ENOMEM)) {
+    // The want is ours and passes; the file is read when it is asked for next.
+    identity_.reset();
+    return;
+  }
   if (content) {
     identity_ = identityOf(status);
     const PropertyList value = parsePropertyList(std::as_bytes(std::span(*content))).find("CountryCode");

@@ -3,6 +3,7 @@
 #include "platform/geo/linux/CountryConfiguration.h"
 
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -86,6 +87,21 @@ TEST_F(CountryConfigurationTest, AFileReplacedIsReadAgain) {
   write("new.plist", *serializePropertyList(code("SE"), PropertyListFormat::xml));
   fs::rename(folder / "new.plist", folder / "country.plist");
   EXPECT_EQ(country.countryCode(), "SE");
+}
+
+TEST_F(CountryConfigurationTest, AFileThatCouldNotBeReadForWantOfDescriptorsIsReadWhenThereAreSomeAgain) {
+  configure(code("NO"));
+  CountryConfiguration country(files());
+  country.setLastGeocoded("FR");
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+  const rlimit none{0, before.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &none), 0);
+  const auto without = country.countryCode();
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
+  EXPECT_EQ(without, "FR");
+  EXPECT_EQ(country.countryCode(), "NO");
+  EXPECT_EQ(log.entries(), std::vector<RecordingLog::Entry>{});
 }
 
 TEST_F(CountryConfigurationTest, ALongCodeIsGivenAsItStands) {
