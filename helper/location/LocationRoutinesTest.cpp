@@ -189,6 +189,17 @@ TEST_F(LocationRoutinesTest, ATimeOutAfterTheAnswerDoesNothingAndLogsNothing) {
   EXPECT_EQ(brenvik.pushes, pushes);
 }
 
+TEST_F(LocationRoutinesTest, ATimeOutAfterTheWanIpAnswerDoesNothingAndLogsNothing) {
+  askWanIp();
+  settle();
+  geo.geoIps[0].answer("198.51.100.7");
+  settle();
+  log.clear();
+  pass(1h);
+  EXPECT_EQ(log.entries(), Lines{});
+  EXPECT_EQ(brenvik.pushes, (Pushes{address("198.51.100.7")}));
+}
+
 TEST_F(LocationRoutinesTest, OfTwoCivicInfoRequestsOnlyTheFirstEventDoesWork) {
   askCivicInfo(48.8584, 2.2945);
   askCivicInfo(51.5007, -0.1246);
