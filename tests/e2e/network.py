@@ -46,7 +46,7 @@ class FarEnd:
         ip("link", "set", name, "up")
         self.ip("link", "set", "lo", "up")
         for address in [theirs] if isinstance(theirs, str) else theirs:
-            self.ip("address", "add", address, "dev", self.far)
+            self.ip("address", "add", address, "dev", self.far, *(["nodad"] if ":" in address else []))
         self.ip("link", "set", self.far, "up")
 
     def _wait_for_own_namespace(self):

@@ -128,14 +128,16 @@ class LocationTest(HelperTest):
     def ask_wan_ip(self, client):
         self.assertEqual(client.status("RequestWanIPFromLocation"), 0)
 
-    def quickest(self, client, attempts=5):
-        """The shortest time that another request took, in seconds."""
+    def check_others_are_served(self, client):
+        """While something waits for a second or more: other requests take milliseconds."""
         times = []
-        for _ in range(attempts):
+        for _ in range(11):
             start = time.monotonic()
             client.text("CopyCountryCode", size=64)
             times.append(time.monotonic() - start)
-        return min(times)
+        # Room for a busy machine, but none for a wait.
+        self.assertLess(sorted(times)[5], 0.05)
+        self.assertLess(max(times), 0.5)
 
     def lines(self, *wanted):
         for line in wanted:
@@ -256,14 +258,10 @@ class BrenvikTest(LocationTest):
     def test_hanging(self):
         brenvik = Brenvik(self, answers=False)
         client = self.client()
-        usual = self.quickest(client)
         start = time.monotonic()
         self.ask_civic(client, 0.0, 0.0)  # the fallback: decided on the main queue
         brenvik.wait_for(1)
-        for _ in range(10):
-            before = time.monotonic()
-            client.text("CopyCountryCode", size=64)
-            self.assertLess(time.monotonic() - before, 0.5 + usual, "served while the push waits")
+        self.check_others_are_served(client)
         self.lines(("bsd", LOG_NOTICE, "sendCivicInfoToQV failed civic info to Brenvik due to error: 110"))
         self.assertGreater(time.monotonic() - start, 0.9)
 
@@ -286,7 +284,7 @@ class BrenvikTest(LocationTest):
                 first.connect(str(path))
                 client = self.client()
                 self.ask_civic(client, 0.0, 0.0)
-                client.text("CopyCountryCode", size=64)
+                self.check_others_are_served(client)
                 self.lines(("bsd", LOG_ERR, "sendCivicInfoToQV to Brenvik failed, could not open QVServerConnection"))
 
     def test_the_stand_in_prints_what_it_is_told(self):
@@ -403,11 +401,17 @@ class WanIpTest(LocationTest):
             self.assertGreaterEqual(at - requests[0][0], due - 0.05)
             self.assertLess(at - requests[0][0], due + 1)
 
+    @staticmethod
+    def seen_as(text, request, identity=None):
+        """The answer of a server that sees the request come from this IPv4 address."""
+        cookie = request[4:8]
+        mapped = bytes([0, 1, 0x11, 0x22, *(a ^ b for a, b in zip(socket.inet_aton(text), cookie))])
+        return b"\x01\x01\x00\x0c" + cookie + (identity or request[8:]) + b"\x00\x20\x00\x08" + mapped
+
     def test_lies_are_ignored_and_said(self):
         def lies(request, sender):
-            mapped = bytes([0, 1, 0x11, 0x22, *(a ^ b for a, b in zip(socket.inet_aton("203.0.113.9"), request[4:8]))])
-            success = lambda identity: b"\x01\x01\x00\x0c" + request[4:8] + identity + b"\x00\x20\x00\x08" + mapped
-            return [b"", b"no STUN", success(bytes(12)), success(request[8:])[:-1], success(request[8:])]
+            truth = self.seen_as("203.0.113.9", request)
+            return [b"", b"no STUN", self.seen_as("203.0.113.66", request, bytes(12)), truth[:-1], truth]
 
         self.stun_server(lies)
         brenvik = Brenvik(self)
@@ -416,22 +420,20 @@ class WanIpTest(LocationTest):
         self.lines(("unified", ERROR, "geo service: ignored what does not answer the STUN request"))
 
     def test_a_civic_answer_takes_the_flag_of_an_outstanding_address_request(self):
-        self.stun_server(lambda request, sender: [])
         brenvik = Brenvik(self)
+        self.stun_server(lambda request, sender: [self.seen_as("203.0.113.9", request)] if brenvik.pushes else [])
         client = self.client()
         self.ask_wan_ip(client)
         self.ask_civic(client, 59.9133, 10.739)
         self.assertEqual(brenvik.wait_for(1), [civic("NO", "Oslo", "Oslo")])
-        self.logs.wait_for(*WAN_IP_NOT_AWAITED, timeout=20)
+        self.lines(WAN_IP_NOT_AWAITED)
         self.assertEqual(len(brenvik.pushes), 1)
 
     def test_the_daemon_serves_others_while_it_waits(self):
         self.stun_server(lambda request, sender: [])
         client = self.client()
-        usual = self.quickest(client)
         self.ask_wan_ip(client)
-        for _ in range(10):
-            self.assertLess(self.quickest(client, 1), 0.5 + usual)
+        self.check_others_are_served(client)
 
 
 class MapServer:
