@@ -199,15 +199,22 @@ std::optional<std::string> Badges::make(std::string_view label) {
   const std::string upper = plain ? *plain : upperCased(windowOf(label), language_);
   std::string badge;
   std::string first;
+  bool passedOver = false;
   Clusters clusters(upper);
   for (std::size_t count = 0; count < kLongestBadge && !clusters.atEnd();) {
     std::size_t parts = 0;
     const std::string_view cluster = clusters.next(&parts);
-    if (!isVisible(cluster)) continue;
+    if (!isVisible(cluster)) {
+      passedOver = true;
+      continue;
+    }
     // More of a label only as far as it is short for whoever counts without GB9c, too.
     count += parts;
     if (!first.empty() && count > kLongestBadge) break;
     badge.append(cutCluster(cluster));
+    // What stood between may have kept a mark from its letter. Now they look like one, so they have to be
+    // one.
+    if (passedOver) badge = composed(badge);
     if (take(badge)) return badge;
     if (first.empty()) first = badge;
   }

@@ -209,6 +209,11 @@ TEST(CatalogueLabelerTest, BlanksAndInvisibleCharactersNeverCount) {
               ElementsAre("A", "AB", "ABC", "A2"));
 }
 
+TEST(CatalogueLabelerTest, BadgesThatLookAlikeAreAlikeWhateverStoodBetweenALetterAndItsMark) {
+  constexpr const char* kSoftHyphenAndAcute = "A\xC2\xAD\xCC\x81";
+  EXPECT_THAT(badges({"A", kSoftHyphenAndAcute, "Á", "áb"}, {"en"}), ElementsAre("A", "Á", "Á2", "ÁB"));
+}
+
 TEST(CatalogueLabelerTest, SharpSGivesOneLetterAndThenTheNext) {
   EXPECT_THAT(badges({"ß", "ß", "ße", "ße"}, {"de"}), ElementsAre("S", "SS", "SSE", "S2"));
 }

@@ -158,6 +158,13 @@ std::string armenianWithoutLigature(std::string_view text) {
   }
 }
 
+// What libunistring has made; nothing but memory can have been in its way, for the text is UTF-8.
+std::string owned(std::uint8_t* made, std::size_t size) {
+  const std::unique_ptr<std::uint8_t, Free> bytes(made);
+  if (bytes == nullptr) throw std::bad_alloc();
+  return {reinterpret_cast<const char*>(bytes.get()), size};
+}
+
 }  // namespace
 
 std::string upperCased(std::string_view text, const char* language) {
@@ -171,10 +178,14 @@ std::string upperCased(std::string_view text, const char* language) {
     text = prepared;
   }
   std::size_t size = 0;
-  const std::unique_ptr<std::uint8_t, Free> upper(
-      u8_toupper(bytesOf(text), text.size(), language, UNINORM_NFC, nullptr, &size));
-  if (upper == nullptr) throw std::bad_alloc();  // nothing else can fail: the text is UTF-8
-  return {reinterpret_cast<const char*>(upper.get()), size};
+  std::uint8_t* const upper = u8_toupper(bytesOf(text), text.size(), language, UNINORM_NFC, nullptr, &size);
+  return owned(upper, size);
+}
+
+std::string composed(std::string_view text) {
+  std::size_t size = 0;
+  std::uint8_t* const made = u8_normalize(UNINORM_NFC, bytesOf(text), text.size(), nullptr, &size);
+  return owned(made, size);
 }
 
 }  // namespace brenvik

@@ -12,4 +12,7 @@ namespace brenvik {
 // Armenian ligature. `text` is UTF-8. Throws std::bad_alloc.
 std::string upperCased(std::string_view text, const char* language);
 
+// The text composed (NFC). `text` is UTF-8. Throws std::bad_alloc.
+std::string composed(std::string_view text);
+
 }  // namespace brenvik
