@@ -177,6 +177,19 @@ std::string_view windowOf(std::string_view label) noexcept {
   return label.substr(0, clusters.offset());
 }
 
+// What a person sees of a badge. The tags that tell one region's flag from another are seen.
+std::string visiblePartOf(std::string_view badge) {
+  std::string seen;
+  while (!badge.empty()) {
+    std::size_t size = 0;
+    const ucs4_t c = firstCharacter(badge, &size);
+    const bool isTag = c >= 0xE0020 && c <= 0xE007F;
+    if (isTag || !uc_is_property_default_ignorable_code_point(c)) seen.append(badge.substr(0, size));
+    badge.remove_prefix(size);
+  }
+  return seen;
+}
+
 // The capitals of a label that starts plainly: its first visible characters, as many as a badge has, are
 // ASCII and nothing else can have a say in them. Nothing for all others. A shortcut and no more, for
 // most of what is written in Latin letters.
@@ -225,6 +238,11 @@ std::optional<std::string> Badges::make(std::string_view label) {
     if (take(numbered)) return numbered;
   }
   return takeCode();
+}
+
+bool Badges::take(const std::string& badge) {
+  const bool plain = std::ranges::all_of(badge, [](char c) { return static_cast<unsigned char>(c) < 0x80; });
+  return taken_.insert(plain ? badge : composed(visiblePartOf(badge))).second;
 }
 
 // 1 to 999, then three characters of 0-9 and A-Z.

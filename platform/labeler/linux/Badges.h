@@ -25,11 +25,12 @@ class Badges {
   std::optional<std::string> make(std::string_view label);
 
  private:
-  bool take(const std::string& badge) { return taken_.insert(badge).second; }
+  // False when the badge looks like one that is taken.
+  bool take(const std::string& badge);
   std::optional<std::string> takeCode();
 
   const char* language_;
-  std::unordered_set<std::string> taken_;
+  std::unordered_set<std::string> taken_;            // what is seen of them
   std::unordered_map<std::string, int> nextNumber_;  // of a first cluster; all smaller ones are taken
   std::uint32_t nextCode_ = 0;
 };

@@ -214,6 +214,19 @@ TEST(CatalogueLabelerTest, BadgesThatLookAlikeAreAlikeWhateverStoodBetweenALette
   EXPECT_THAT(badges({"A", kSoftHyphenAndAcute, "Á", "áb"}, {"en"}), ElementsAre("A", "Á", "Á2", "ÁB"));
 }
 
+TEST(CatalogueLabelerTest, BadgesThatDifferOnlyInWhatNobodySeesAreAlike) {
+  EXPECT_THAT(badges({"A", "A\xE2\x80\x8D", "A\xEF\xB8\x8F"}, {"en"}), ElementsAre("A",
+                                                                                   "A\xE2\x80\x8D"
+                                                                                   "2",
+                                                                                   "A\xEF\xB8\x8F"
+                                                                                   "3"));
+  EXPECT_THAT(badges({"👨‍👩‍👧", "👨‍👩‍👦", "🏴󠁧󠁢󠁥󠁮󠁧󠁿",
+                      "🏴󠁧󠁢󠁳󠁣󠁴󠁿"},
+                     {"en"}),
+              ElementsAre("👨‍👩‍👧", "👨‍👩‍👦", "🏴󠁧󠁢󠁥󠁮󠁧󠁿",
+                          "🏴󠁧󠁢󠁳󠁣󠁴󠁿"));
+}
+
 TEST(CatalogueLabelerTest, SharpSGivesOneLetterAndThenTheNext) {
   EXPECT_THAT(badges({"ß", "ß", "ße", "ße"}, {"de"}), ElementsAre("S", "SS", "SSE", "S2"));
 }

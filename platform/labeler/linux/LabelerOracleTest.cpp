@@ -8,6 +8,7 @@
 #include <unicode/localebuilder.h>
 #include <unicode/localematcher.h>
 #include <unicode/normalizer2.h>
+#include <unicode/uchar.h>
 #include <unicode/unistr.h>
 
 #include <algorithm>
@@ -46,6 +47,18 @@ std::string utf8(const icu::UnicodeString& text) {
   std::string result;
   text.toUTF8String(result);
   return result;
+}
+
+// Without what ICU counts among the characters that nobody sees, but with the tags that make up flags.
+std::string visiblePartOf(const std::string& text) {
+  const icu::UnicodeString characters = icu::UnicodeString::fromUTF8(text);
+  icu::UnicodeString seen;
+  for (std::int32_t i = 0; i < characters.length(); i = characters.moveIndex32(i, 1)) {
+    const UChar32 c = characters.char32At(i);
+    const bool isTag = c >= 0xE0020 && c <= 0xE007F;
+    if (isTag || !u_hasBinaryProperty(c, UCHAR_DEFAULT_IGNORABLE_CODE_POINT)) seen.append(c);
+  }
+  return utf8(composed(seen));
 }
 
 class Clusters {
@@ -205,6 +218,7 @@ TEST(LabelerOracleTest, BadgesOfRandomListsAreDistinctShortAndTheSameEveryTime) 
       std::string label = random.below(3) == 0 ? random.oneOf(identifiers) : random.label(3);
       // Something invisible between a letter and its mark.
       if (random.below(8) == 0) label += "a\u00AD\u0301";
+      if (random.below(8) == 0) label += random.below(2) == 0 ? "\u200D" : "\u200D\u0301";
       labels.push_back(PropertyList::string(label));
       trace += label + "|";
     }
@@ -217,7 +231,7 @@ TEST(LabelerOracleTest, BadgesOfRandomListsAreDistinctShortAndTheSameEveryTime) 
     std::set<std::string> seen;
     for (std::size_t i = 0; i < made.size(); ++i) {
       const std::string badge(made.at(i).asString().value());
-      EXPECT_TRUE(seen.insert(badge).second) << "twice: " << badge;
+      EXPECT_TRUE(seen.insert(visiblePartOf(badge)).second) << "twice: " << badge;
       EXPECT_EQ(badge, utf8(composed(icu::UnicodeString::fromUTF8(badge))));
       EXPECT_GE(clusters.count(badge), 1);
       EXPECT_LE(clusters.count(badge), 3) << badge;
