@@ -21,6 +21,8 @@ namespace {
 
 constexpr int kBusyMilliseconds = 1000;  // as long as the main loop may wait for another process
 
+constexpr const char* kFolderInTheMaking = ".brenvik-folder";
+
 constexpr const char* kSchema =
     "CREATE TABLE IF NOT EXISTS general(id INTEGER PRIMARY KEY CHECK(id = 0), token TEXT NOT NULL);"
     "CREATE TABLE IF NOT EXISTS tokens(key TEXT PRIMARY KEY NOT NULL, token TEXT NOT NULL) WITHOUT ROWID;";
@@ -36,9 +38,15 @@ UniqueFd enterDirectory(int parent, const char* name, mode_t mode, uid_t uid, gi
   constexpr int kFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
   UniqueFd fd(::openat(parent, name, kFlags));
   if (fd.isValid() || errno != ENOENT || !create) return fd;
-  if (::mkdirat(parent, name, 0700) != 0) return {};
-  fd.reset(::openat(parent, name, kFlags));
-  if (fd.isValid() && (::fchown(fd.get(), uid, gid) != 0 || ::fchmod(fd.get(), mode) != 0)) return {};
+  // Under another name until it is the account's: killed in between, a helper would leave the account a
+  // folder that it may not enter. One left so is used.
+  if (::mkdirat(parent, kFolderInTheMaking, 0700) != 0 && errno != EEXIST) return {};
+  fd.reset(::openat(parent, kFolderInTheMaking, kFlags));
+  if (!fd.isValid() || ::fchown(fd.get(), uid, gid) != 0 || ::fchmod(fd.get(), mode) != 0 ||
+      ::renameat(parent, kFolderInTheMaking, parent, name) != 0) {
+    (void)::unlinkat(parent, kFolderInTheMaking, AT_REMOVEDIR);  // the next attempt copes with what stays
+    return {};
+  }
   (void)::fsync(parent);  // or a power cut takes the folder with the tokens in it
   return fd;
 }

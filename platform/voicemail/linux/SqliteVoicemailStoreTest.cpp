@@ -105,6 +105,39 @@ TEST_F(SqliteVoicemailStoreTest, ReadingMakesNothingAndWritingMakesAPrivateFileO
   EXPECT_EQ(statOf(home / "Library").st_mode, S_IFDIR | 0755u);
 }
 
+TEST_F(SqliteVoicemailStoreTest, AFolderThatAKilledProcessLeftHalfMadeIsFinished) {
+  ASSERT_EQ(::mkdir((home / ".brenvik-folder").c_str(), 0700), 0);
+  home.directory("Library/.brenvik-folder");
+  const uid_t owner = ::geteuid() == 0 ? 4711 : ::getuid();
+  SqliteVoicemailStore of(home.path(), owner, ::getgid());
+  of.setToken(&token);
+  EXPECT_EQ(of.copyToken(), token);
+  EXPECT_EQ(statOf(home / "Library/Voicemail").st_mode, S_IFDIR | 0700u);
+  EXPECT_EQ(statOf(home / "Library/Voicemail").st_uid, owner);
+  EXPECT_FALSE(isThere(home / "Library/.brenvik-folder"));
+}
+
+TEST_F(SqliteVoicemailStoreTest, KilledWhileItMakesItsFoldersItNeverShowsOneTheAccountMayNotEnter) {
+  const uid_t owner = ::geteuid() == 0 ? 4711 : ::getuid();
+  const gid_t group = ::geteuid() == 0 ? 4712 : ::getgid();
+  SqliteVoicemailStore of(home.path(), owner, group);
+  for (int round = 0; round < 60; ++round) {
+    const pid_t child = ::fork();
+    if (child == 0) {
+      killThisProcessAfter(std::chrono::microseconds(100 + round * 41));
+      for (;;) of.setToken(&token);
+    }
+    ::waitpid(child, nullptr, 0);
+    for (const char* name : {"Library", "Library/Voicemail"}) {
+      if (!isThere(home / name)) continue;
+      EXPECT_EQ(statOf(home / name).st_mode, name[7] == '/' ? S_IFDIR | 0700u : S_IFDIR | 0755u) << round;
+      EXPECT_EQ(statOf(home / name).st_uid, owner) << round;
+      EXPECT_EQ(statOf(home / name).st_gid, group) << round;
+    }
+    std::filesystem::remove_all(home / "Library");
+  }
+}
+
 TEST_F(SqliteVoicemailStoreTest, AnotherObjectSeesWhatWasSet) {
   store.setToken(&token);
   SqliteVoicemailStore second(home.path(), ::getuid(), ::getgid());
