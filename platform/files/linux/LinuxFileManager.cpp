@@ -96,40 +96,41 @@ struct ResolvedAttributes {
   gid_t gid = static_cast<gid_t>(-1);
 };
 
-// Makes one directory and gives it exactly these attributes; removes it again when it cannot have them.
-int makeDirectory(const char* path, const ResolvedAttributes& attributes) {
-  if (::mkdir(path, attributes.mode & 0700) != 0) return errno;
-  const UniqueFd made(::open(path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-  int error = 0;
-  if (made.isValid()) {
-    const bool giveAway =
-        attributes.uid != static_cast<uid_t>(-1) || attributes.gid != static_cast<gid_t>(-1);
-    if (giveAway && ::fchown(made.get(), attributes.uid, attributes.gid) != 0) error = errno;
-    if (error == 0 && ::fchmod(made.get(), attributes.mode) != 0) error = errno;
-  } else if (::chmod(path, attributes.mode) != 0) {  // a mode without read, for an ordinary user
-    error = errno;
-  }
-  if (error != 0) (void)::rmdir(path);  // the failure already has its code
-  return error;
+// Makes one directory with exactly these attributes. It shows under its name only with them: a directory in
+// the making would be taken for the finished one by the next call.
+int makeDirectory(const std::string& path, const ResolvedAttributes& attributes) {
+  Place place;
+  if (const int error = Place::open(path, &place); error != 0) return error;
+  struct stat there {};
+  if (::fstatat(place.directory.get(), place.name.c_str(), &there, AT_SYMLINK_NOFOLLOW) == 0) return EEXIST;
+  Stage stage(place);
+  if (const int error = stage.makeDirectory(); error != 0) return error;
+  const bool giveAway = attributes.uid != static_cast<uid_t>(-1) || attributes.gid != static_cast<gid_t>(-1);
+  if (giveAway && ::fchown(stage.get(), attributes.uid, attributes.gid) != 0) return errno;
+  if (::fchmod(stage.get(), attributes.mode & 07777) != 0) return errno;
+  return stage.publish(IfPresent::fail);
+}
+
+bool isDirectory(const std::string& path) {
+  struct stat info {};
+  return ::stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode);
 }
 
 int makeDirectories(const std::string& path, const ResolvedAttributes& attributes) {
-  const int error = makeDirectory(path.c_str(), attributes);
+  const int error = makeDirectory(path, attributes);
+  if (error == 0 || isDirectory(path)) return 0;
   struct stat info {};
-  if (error == EEXIST) {
-    return ::stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode) ? 0 : EEXIST;
-  }
-  if (error != ENOENT) return error;
+  const bool isMissing = ::lstat(path.c_str(), &info) != 0 && errno == ENOENT;
+  // "missing/." is said to be there: it names a directory by itself.
+  if (error != ENOENT && !(error == EEXIST && isMissing)) return error;
   // From the first directory that is missing, down.
   for (std::size_t slash = path.find('/', 1); slash != std::string::npos; slash = path.find('/', slash + 1)) {
     const std::string above = path.substr(0, slash);
     if (::stat(above.c_str(), &info) == 0) continue;
-    if (const int failed = makeDirectory(above.c_str(), attributes); failed != 0 && failed != EEXIST)
-      return failed;
+    if (const int failed = makeDirectory(above, attributes); failed != 0 && failed != EEXIST) return failed;
   }
-  const int last = makeDirectory(path.c_str(), attributes);
-  // "a/b/" was made by the loop.
-  return last == EEXIST && ::stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode) ? 0 : last;
+  const int last = makeDirectory(path, attributes);
+  return last == EEXIST && isDirectory(path) ? 0 : last;  // "a/b/" was made by the loop
 }
 
 }  // namespace
@@ -253,7 +254,7 @@ FileOutcome LinuxFileManager::createDirectory(const std::string& path, const Dir
       if (const int error = idOfGroup(attributes.groupName, &resolved.gid); error != 0) return error;
     }
     return intermediates == Intermediates::create ? makeDirectories(path, resolved)
-                                                  : makeDirectory(path.c_str(), resolved);
+                                                  : makeDirectory(path, resolved);
   });
 }
 
@@ -329,9 +330,10 @@ FileOutcome LinuxFileManager::setAttributes(const std::string& path,
       if (::fchownat(AT_FDCWD, path.c_str(), uid, gid, AT_SYMLINK_NOFOLLOW) != 0) return errno;
     }
     if (attributes.mode) {
-      struct stat info {};
-      if (::lstat(path.c_str(), &info) != 0) return errno;
-      if (!S_ISLNK(info.st_mode) && ::chmod(path.c_str(), *attributes.mode & 07777) != 0) return errno;
+      // Of the item itself: whoever owns the directory may put a link in its place at any moment.
+      const mode_t mode = *attributes.mode & 07777;
+      if (::fchmodat(AT_FDCWD, path.c_str(), mode, AT_SYMLINK_NOFOLLOW) != 0 && errno != EOPNOTSUPP)
+        return errno;
     }
     return 0;
   });

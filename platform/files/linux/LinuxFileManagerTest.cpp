@@ -555,6 +555,25 @@ TEST_F(LinuxFileManagerTest, AWriteInPlaceRefusesALinkAndDoesNotWaitForAReader) 
 
 // ---- killed at any moment
 
+TEST_F(LinuxFileManagerTest, KilledAtAnyMomentADirectoryShowsWithItsModeOrNotAtAll) {
+  for (int round = 0; round < 100; ++round) {
+    const pid_t child = ::fork();
+    if (child == 0) {
+      killThisProcessAfter(std::chrono::microseconds(50 + round * 3));
+      for (int i = 0;; ++i) {
+        (void)files.createDirectory(dir / ("work/" + std::to_string(i) + "/below"), {0755, "", ""},
+                                    Intermediates::create);
+      }
+    }
+    ::waitpid(child, nullptr, 0);
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(dir.path())) {
+      if (entry.path().filename().string().starts_with(".brenvik-")) continue;
+      ASSERT_EQ(statOf(entry.path()).st_mode, S_IFDIR | 0755u) << entry.path() << " in round " << round;
+    }
+    std::filesystem::remove_all(dir / "work");
+  }
+}
+
 TEST_F(LinuxFileManagerTest, KilledAtAnyMomentTheOldFileOrTheNewOneStandsAndNeverHalf) {
   const std::string oldContent(300'000, 'o');
   const std::string newContent(300'000, 'n');

@@ -77,7 +77,8 @@ int TreeCopier::copySpecial(int sourceDirectory, const char* name, const struct 
   const bool owned =
       ::fchownat(destinationDirectory, destinationName, info.st_uid, info.st_gid, AT_SYMLINK_NOFOLLOW) == 0;
   if (!S_ISLNK(info.st_mode) &&
-      ::fchmodat(destinationDirectory, destinationName, info.st_mode & (owned ? 07777 : 01777), 0) != 0) {
+      ::fchmodat(destinationDirectory, destinationName, info.st_mode & (owned ? 07777 : 01777),
+                 AT_SYMLINK_NOFOLLOW) != 0) {
     return errno;
   }
   const timespec times[2] = {info.st_atim, info.st_mtim};
