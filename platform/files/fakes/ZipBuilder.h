@@ -22,6 +22,9 @@ class ZipBuilder {
     std::optional<std::uint32_t> claimedChecksum = std::nullopt;
     bool isZip64 = false;
     bool hasDescriptor = false;  // sizes and checksum behind the data
+    std::optional<std::string> localName =
+        std::nullopt;         // another name before the data than in the directory
+    bool sharesData = false;  // with the entry before: only its directory has it
   };
 
   ZipBuilder& add(Entry entry) {
@@ -41,8 +44,10 @@ class ZipBuilder {
   std::string build() const {
     std::string out;
     std::string central;
+    std::uint64_t offset = 0;
     for (const Entry& entry : entries_) {
-      const std::uint64_t offset = out.size();
+      if (!entry.sharesData) offset = out.size();
+      const std::string& localName = entry.localName ? *entry.localName : entry.name;
       const std::uint32_t checksum = entry.claimedChecksum.value_or(checksumOf(entry.content));
       const std::uint32_t size = entry.claimedSize.value_or(static_cast<std::uint32_t>(entry.content.size()));
       const auto stored = static_cast<std::uint32_t>(entry.content.size());
@@ -53,11 +58,13 @@ class ZipBuilder {
       const std::uint64_t shownStored = entry.isZip64 ? 0xFFFFFFFF : stored;
       const std::string common =
           le(entry.isZip64 ? 45 : 20, 2) + le(flags, 2) + le(0, 2) + le(0, 2) + le(0x5821, 2);
-      out += le(0x04034b50, 4) + common +
-             (entry.hasDescriptor ? le(0, 4) + le(0, 4) + le(0, 4)
-                                  : le(checksum, 4) + le(shownStored, 4) + le(shownSize, 4)) +
-             le(entry.name.size(), 2) + le(extra.size(), 2) + entry.name + extra + entry.content;
-      if (entry.hasDescriptor) out += le(0x08074b50, 4) + le(checksum, 4) + le(stored, 4) + le(size, 4);
+      if (!entry.sharesData) {
+        out += le(0x04034b50, 4) + common +
+               (entry.hasDescriptor ? le(0, 4) + le(0, 4) + le(0, 4)
+                                    : le(checksum, 4) + le(shownStored, 4) + le(shownSize, 4)) +
+               le(localName.size(), 2) + le(extra.size(), 2) + localName + extra + entry.content;
+        if (entry.hasDescriptor) out += le(0x08074b50, 4) + le(checksum, 4) + le(stored, 4) + le(size, 4);
+      }
       central += le(0x02014b50, 4) + le(0x0314, 2) + common + le(checksum, 4) + le(shownStored, 4) +
                  le(shownSize, 4) + le(entry.name.size(), 2) + le(extra.size(), 2) + le(0, 2) + le(0, 2) +
                  le(0, 2) + le(std::uint64_t{entry.mode} << 16, 4) + le(offset, 4) + entry.name + extra;

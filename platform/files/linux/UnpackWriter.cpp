@@ -168,6 +168,11 @@ int UnpackWriter::entryCompanion(std::string_view bytes) {
     if (const int error = makeFile(name.c_str(), 0644, &companion_); error != 0) {
       if (!isFileError(error)) return error;
       skipping_ = true;
+      if (file_.isValid()) {
+        // Its data is still to come and will not be taken: no empty file stays in its place.
+        (void)::unlinkat(parent_.get(), name_.c_str(), 0);
+        file_.reset();
+      }
       return fileError(above.empty() ? name : above + "/" + name, error);
     }
   }

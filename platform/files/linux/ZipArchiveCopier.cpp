@@ -7,11 +7,12 @@
 #include <sys/statvfs.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <new>
+#include <vector>
 
-#include "platform/files/linux/LinuxFileManager.h"
 #include "platform/files/linux/Placement.h"
 #include "platform/files/linux/ReaderProcess.h"
 #include "platform/files/linux/StagedMerge.h"
@@ -21,6 +22,7 @@ namespace brenvik {
 namespace {
 
 constexpr const char* kReaderName = "brenvik-archive-reader";
+constexpr mode_t kDirectoryMode = 0755;
 
 bool isOn(const PropertyList& options, const char* name) {
   return options.find(name).asBoolean().value_or(false);
@@ -39,6 +41,41 @@ std::string findReader() {
   installed += '/';
   installed += kReaderName;
   return ::access(installed.c_str(), X_OK) == 0 ? installed : std::string();
+}
+
+// A destination that is not there: the first directory on its way that has to be made, and the names below
+// it.
+struct MissingPath {
+  Place place;
+  std::vector<std::string> below;
+};
+
+// 0 or errno: EEXIST for a path with ".." in its missing part, which leads nowhere that can be made.
+int findMissing(std::string path, MissingPath* missing) {
+  for (;;) {
+    while (path.size() > 1 && path.back() == '/') path.pop_back();
+    const int error = Place::open(path, &missing->place);
+    if (error == 0) break;
+    const std::size_t slash = path.rfind('/');
+    const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
+    const bool isHere = error == EEXIST && name == ".";
+    if ((error != ENOENT && !isHere) || slash == std::string::npos || slash == 0) return error;
+    if (!isHere) missing->below.push_back(name);
+    path.resize(slash);
+  }
+  std::reverse(missing->below.begin(), missing->below.end());
+  return 0;
+}
+
+// Makes the names below the directory, one in the other, and opens the last. 0 or errno.
+int makeBelow(int directory, const std::vector<std::string>& names, UniqueFd* last) {
+  last->reset(::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  for (const std::string& name : names) {
+    if (!last->isValid() || ::mkdirat(last->get(), name.c_str(), 0700) != 0) return errno;
+    last->reset(::openat(last->get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (!last->isValid() || ::fchmod(last->get(), kDirectoryMode) != 0) return errno;
+  }
+  return last->isValid() ? 0 : errno;
 }
 
 }  // namespace
@@ -63,8 +100,9 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
   if (!S_ISREG(info.st_mode)) return EINVAL;
 
   // Beside a destination that is still to be made, or inside one that is there: on its file system either
-  // way.
-  Place place;
+  // way. Directories missing above it are made with it, so that an archive that fails leaves none behind.
+  MissingPath missing;
+  Place& place = missing.place;
   UniqueFd existing(::open(destination.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (existing.isValid()) {
     place.directory.reset(::openat(existing.get(), ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
@@ -72,25 +110,16 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
     if (!place.directory.isValid()) return errno;
   } else {
     if (errno != ENOENT) return errno;
-    int error = Place::open(destination, &place);
-    if (error == ENOENT) {
-      const std::size_t slash = destination.find_last_not_of('/') == std::string::npos
-                                    ? std::string::npos
-                                    : destination.rfind('/', destination.find_last_not_of('/'));
-      if (slash == std::string::npos || slash == 0) return ENOENT;
-      const FileOutcome made =
-          LinuxFileManager().createDirectory(destination.substr(0, slash), {}, Intermediates::create);
-      if (!made.succeeded()) return made.codeOr(EIO);
-      error = Place::open(destination, &place);
-    }
-    if (error != 0) return error;
+    if (const int error = findMissing(destination, &missing); error != 0) return error;
   }
 
   Stage stage(place);
   if (const int error = stage.makeDirectory(); error != 0) return error;
   struct statvfs disk {};
   if (::fstatvfs(stage.get(), &disk) != 0) return errno;
-  UnpackWriter writer(stage.get(), {isOn(options, "copyExtendedAttributes"), isOn(options, "copyResources")},
+  UniqueFd top;
+  if (const int error = makeBelow(stage.get(), missing.below, &top); error != 0) return error;
+  UnpackWriter writer(top.get(), {isOn(options, "copyExtendedAttributes"), isOn(options, "copyResources")},
                       std::uint64_t{disk.f_bavail} * disk.f_frsize, onFileError_);
   ArchiveFrameParser parser(writer);
   {
@@ -106,7 +135,7 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
     if (const int error = checkMerge(stage.get(), existing.get()); error != 0) return error;
     return mergeStaged(stage.get(), existing.get());
   }
-  if (::fchmod(stage.get(), 0755) != 0) return errno;
+  if (::fchmod(stage.get(), kDirectoryMode) != 0) return errno;
   return stage.publish(IfPresent::fail);
 }
 

@@ -147,8 +147,27 @@ TEST_F(ZipArchiveCopierTest, LargeFilesComeOutByteForByte) {
 
 TEST_F(ZipArchiveCopierTest, AnEmptyArchiveMakesAnEmptyDestinationAndMissingFoldersAboveIt) {
   const std::string archive = dir.file("empty.zip", ZipBuilder().build());
-  EXPECT_EQ(copy(archive, dir / "not/yet/there/"), 0);
+  const mode_t before = ::umask(0077);
+  EXPECT_EQ(copy(archive, dir / "not/./yet//there/"), 0);
+  ::umask(before);
   EXPECT_TRUE(std::filesystem::is_empty(dir / "not/yet/there"));
+  for (const char* made : {"not", "not/yet", "not/yet/there"}) {
+    EXPECT_EQ(statOf(dir / made).st_mode, S_IFDIR | 0755u) << made;
+  }
+}
+
+TEST_F(ZipArchiveCopierTest, AnArchiveThatFailsLeavesNoFoldersAboveItsDestination) {
+  const std::string archive = dir.file("archive.zip", ZipBuilder().file("../outside", "x").build());
+  EXPECT_NE(copy(archive, dir / "not/yet/there"), 0);
+  EXPECT_EQ(everything(), (std::set<std::string>{"archive.zip"}));
+  const std::string good = dir.file("archive.zip", ZipBuilder().file("a", "x").build());
+  EXPECT_NE(copy(good, dir / "not/../there"), 0);
+  dir.link("dangling", "nowhere");
+  EXPECT_EQ(copy(good, dir / "dangling/there"), EEXIST);
+  EXPECT_EQ(copy(good, dir / "dangling"), EEXIST);
+  EXPECT_EQ(copy(good, dir / "archive.zip/there"), ENOTDIR);
+  EXPECT_EQ(copy(good, ""), ENOENT);
+  EXPECT_EQ(everything(), (std::set<std::string>{"archive.zip", "dangling"}));
 }
 
 TEST_F(ZipArchiveCopierTest, IntoADirectoryThatIsThereFilesAreReplacedAndOthersKept) {
@@ -280,6 +299,8 @@ std::vector<Hostile> hostileArchives() {
   add("wrong checksum").add({.name = "bad", .content = "x", .claimedChecksum = 1});
   add("claims more than it has").add({.name = "bad", .content = "x", .claimedSize = 1000});
   add("claims less than it has").add({.name = "bad", .content = "0123456789", .claimedSize = 2});
+  add("hostile name before the data only")
+      .add({.name = "harmless", .content = "x", .localName = "../outside"});
   add("companion over a file")
       .file("._name", "own")
       .file("name", "x")
@@ -314,6 +335,16 @@ TEST_F(ZipArchiveCopierTest, ARefusedEntryIsAFileErrorThatAHandlerMayPassOver) {
   EXPECT_EQ(fatal, std::nullopt);
   EXPECT_EQ(contentOf(dir / "out/good"), "g");
   EXPECT_EQ(everything(), (std::set<std::string>{"archive.zip", "out", "out/good"}));
+}
+
+TEST_F(ZipArchiveCopierTest, AFileThatIsPassedOverForItsCompanionDoesNotStayEmpty) {
+  answer = archive_answer::skipFile;
+  ZipBuilder zip;
+  zip.file("._name", "own").file("name", "content").file("__MACOSX/._name", companionWith("a", "b"));
+  EXPECT_EQ(unpack(zip.build()), 0);
+  EXPECT_EQ(fileErrors, (std::vector<std::string>{"._name"}));
+  EXPECT_EQ(everything(), (std::set<std::string>{"archive.zip", "out", "out/._name"}));
+  EXPECT_EQ(contentOf(dir / "out/._name"), "own");
 }
 
 TEST_F(ZipArchiveCopierTest, AnAnswerToAFileErrorIsNotAFatalErrorOnTop) {
@@ -373,6 +404,18 @@ TEST_F(ZipArchiveCopierTest, MoreEntriesThanTheCapAreRefused) {
   answer = archive_answer::skipFile;
   EXPECT_EQ(copyFrames(frames + kEnd), EFBIG);
   EXPECT_EQ(copyFrames(frames.substr(one.size()) + kEnd), 0);
+}
+
+TEST_F(ZipArchiveCopierTest, ManyNamesForTheDataOfOneEntryGiveOneFileInside) {
+  // A bomb without compression: a thousand entries in the directory, and the bytes of one.
+  ZipBuilder zip;
+  zip.file("0", std::string(4000, 'b'));
+  for (int i = 1; i < 1000; ++i) {
+    const std::string name = i % 2 == 0 ? std::to_string(i) : "../outside" + std::to_string(i);
+    zip.add({.name = name, .content = std::string(4000, 'b'), .sharesData = true});
+  }
+  EXPECT_EQ(unpack(zip.build()), 0);
+  EXPECT_EQ(everything(), (std::set<std::string>{"archive.zip", "out", "out/0"}));
 }
 
 TEST_F(ZipArchiveCopierTest, OnASmallDiskABombEndsAtItsEdgeAndLeavesNothing) {
