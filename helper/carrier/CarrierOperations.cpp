@@ -20,7 +20,8 @@ namespace {
 
 constexpr mode_t kBundlesDirectoryMode = 0755;
 constexpr const char* kCrashLogs = "Library/Logs/CrashReporter/";
-constexpr const char* kLinkInTheMaking = "/.brenvik-link";
+constexpr const char* kLinkInTheMaking = "/.brenvik-link-";
+constexpr int kHiddenNames = 4;
 
 void terminate(char* field, std::size_t size) { field[size - 1] = '\0'; }
 
@@ -34,19 +35,27 @@ KernelReturn guarded(KernelReturn onException, Work work) noexcept {
   }
 }
 
+// Makes the link under a free name in the directory; empty when there is none to be had.
+std::string makeHiddenLink(const char* target, const std::string& directory) {
+  for (int number = 0; number < kHiddenNames; ++number) {
+    std::string path = directory + kLinkInTheMaking + std::to_string(number);
+    if (::symlink(target, path.c_str()) == 0) return path;
+    if (errno != EEXIST) return {};
+    // One that a killed process has left goes; what somebody put there to be in the way costs one name.
+    if (::unlink(path.c_str()) == 0 && ::symlink(target, path.c_str()) == 0) return path;
+  }
+  return {};
+}
+
 // Puts a new link where something else stands, in one step, so that a kill or a full disk leaves the old or
 // the new.
 bool exchangeForLink(const char* target, const char* linkPath) {
   const std::string path = linkPath;
   const std::size_t slash = path.rfind('/');
-  const std::string temporary = (slash == std::string::npos ? "." : path.substr(0, slash)) + kLinkInTheMaking;
-  // One that a killed process has left would be in the way.
-  if (::symlink(target, temporary.c_str()) != 0 &&
-      (errno != EEXIST || ::unlink(temporary.c_str()) != 0 || ::symlink(target, temporary.c_str()) != 0)) {
-    return false;
-  }
-  if (::rename(temporary.c_str(), linkPath) == 0) return true;
-  (void)::unlink(temporary.c_str());  // the failure of the rename is the answer
+  const std::string hidden = makeHiddenLink(target, slash == std::string::npos ? "." : path.substr(0, slash));
+  if (hidden.empty()) return false;
+  if (::rename(hidden.c_str(), linkPath) == 0) return true;
+  (void)::unlink(hidden.c_str());  // the failure of the rename is the answer
   return false;
 }
 

@@ -119,10 +119,19 @@ TEST_F(CarrierOperationsTest, ALinkThatCannotBeMadeLeavesWhatWasThere) {
 
 TEST_F(CarrierOperationsTest, ALeftoverOfAKilledReplacementIsNoObstacle) {
   const std::string file = elsewhere.file("file", "old");
-  elsewhere.link(".brenvik-link", "left behind");
+  elsewhere.link(".brenvik-link-0", "left behind");
   EXPECT_EQ(operations.createSymlink(kPort, Long("new").data(), Long(file).data()), 0);
   EXPECT_EQ(std::filesystem::read_symlink(file), "new");
-  EXPECT_FALSE(isThere(elsewhere / ".brenvik-link"));
+  EXPECT_FALSE(isThere(elsewhere / ".brenvik-link-0"));
+}
+
+TEST_F(CarrierOperationsTest, ADirectoryPlantedUnderTheHiddenNameIsNoObstacle) {
+  const std::string file = elsewhere.file("file", "old");
+  elsewhere.file(".brenvik-link-0/planted", "x");
+  EXPECT_EQ(operations.createSymlink(kPort, Long("new").data(), Long(file).data()), 0);
+  EXPECT_EQ(std::filesystem::read_symlink(file), "new");
+  EXPECT_FALSE(isThere(elsewhere / ".brenvik-link-1"));
+  EXPECT_TRUE(isThere(elsewhere / ".brenvik-link-0/planted"));
 }
 
 TEST_F(CarrierOperationsTest, UnterminatedFieldsAreCutAtTheirLastByte) {

@@ -40,6 +40,16 @@ std::array<char, kPathBuffer> cutCopy(const std::string& path) {
   return copy;
 }
 
+std::string baseNameOf(const std::string& path) {
+  std::array<char, kPathBuffer> copy = cutCopy(path);
+  return ::basename(copy.data());
+}
+
+std::string directoryNameOf(const std::string& path) {
+  std::array<char, kPathBuffer> copy = cutCopy(path);
+  return ::dirname(copy.data());
+}
+
 bool isForWantOfRoom(const FileOutcome& outcome) {
   const int code = outcome.codeOr(0);
   return code == ENOSPC || code == EDQUOT;
@@ -74,7 +84,7 @@ int FileSystemManager::copyOrMove(Mode mode, const std::string& source, const st
   bool gives = true;  // what stands at the effective destination
   if (destinationIsDirectory) {
     effective += '/';
-    effective += baseName(source);
+    effective += baseNameOf(source);
     bool isDirectoryThere = false;
     gives = files().itemExists(effective, &isDirectoryThere) && !isDirectoryThere;
   }
@@ -101,7 +111,7 @@ class FileSystemManager::Merge final : public ItemVisitor {
     bool toIsDirectory = false;
     const bool bothExist =
         owner_.files().itemExists(from, &fromIsDirectory) && owner_.files().itemExists(to, &toIsDirectory);
-    std::string parent = owner_.directoryName(to);
+    std::string parent = directoryNameOf(to);
     if (parent != lastParent_) {
       (void)owner_.createDirectory(parent, kDirectoryMode, true);  // without it the transfer fails by itself
       lastParent_ = std::move(parent);
@@ -265,17 +275,11 @@ int FileSystemManager::removeItem(const std::string& path) noexcept {
 }
 
 std::string FileSystemManager::baseName(const std::string& path) noexcept {
-  return guarded(std::string(), [&] {
-    std::array<char, kPathBuffer> copy = cutCopy(path);
-    return std::string(::basename(copy.data()));
-  });
+  return guarded(std::string(), [&] { return baseNameOf(path); });
 }
 
 std::string FileSystemManager::directoryName(const std::string& path) noexcept {
-  return guarded(std::string(), [&] {
-    std::array<char, kPathBuffer> copy = cutCopy(path);
-    return std::string(::dirname(copy.data()));
-  });
+  return guarded(std::string(), [&] { return directoryNameOf(path); });
 }
 
 std::string FileSystemManager::resolvePath(const std::string& path) noexcept {
