@@ -197,6 +197,109 @@ TEST_F(LinuxFileManagerTest, ADirectoryOfManyFilesIsCopiedWholeByTwoThreads) {
   EXPECT_EQ(names("copy").size(), 501u);
 }
 
+// Directories enough for two threads, one in the other and side by side.
+class LinuxFileManagerTwoThreadsTest : public LinuxFileManagerTest {
+ protected:
+  static constexpr int kDirectories = 24;
+  static constexpr int kFilesEach = 40;
+
+  static std::string directoryName(int i) {
+    return "tree/" + std::string(i % 3 == 0 ? "" : "deep/er/") + std::to_string(i);
+  }
+  LinuxFileManagerTwoThreadsTest() {
+    for (int i = 0; i < kDirectories; ++i) {
+      for (int k = 0; k < kFilesEach; ++k) {
+        const std::string name = directoryName(i) + "/" + std::to_string(k);
+        dir.file(name, name);
+      }
+      dir.link(directoryName(i) + "/link", std::to_string(i));
+    }
+    // Names of one file in two directories, so that each thread may meet one first.
+    for (int i = 0; i + 1 < kDirectories; i += 2) {
+      const std::string first = dir / (directoryName(i) + "/7");
+      EXPECT_EQ(::link(first.c_str(), (dir / (directoryName(i + 1) + "/again")).c_str()), 0);
+    }
+    for (int i = 0; i < kDirectories; ++i) {
+      EXPECT_EQ(::chmod((dir / directoryName(i)).c_str(), i % 2 == 0 ? 0555 : 0711), 0);
+      setTimes(dir / directoryName(i), 3000, 4000 + i);
+    }
+    setTimes(dir / "tree", 3000, 5000);
+  }
+  // An ordinary user removes nothing from a directory closed to writing.
+  ~LinuxFileManagerTwoThreadsTest() override {
+    for (int i = 0; i < kDirectories; ++i) (void)::chmod((dir / directoryName(i)).c_str(), 0755);
+  }
+};
+
+TEST_F(LinuxFileManagerTwoThreadsTest, ATreeOfManyDirectoriesIsCopiedWithEverythingAndRemoved) {
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  for (int i = 0; i < kDirectories; ++i) {
+    const std::string from = directoryName(i);
+    const std::string to = "copy" + from.substr(4);
+    for (int k = 0; k < kFilesEach; ++k) {
+      const std::string name = "/" + std::to_string(k);
+      ASSERT_EQ(contentOf(dir / (to + name)), from + name);
+      ASSERT_EQ(statOf(dir / (to + name)).st_mtim.tv_nsec, statOf(dir / (from + name)).st_mtim.tv_nsec);
+    }
+    EXPECT_EQ(std::filesystem::read_symlink(dir / (to + "/link")), std::to_string(i));
+    EXPECT_EQ(statOf(dir / to).st_mode & 07777, i % 2 == 0 ? 0555u : 0711u);
+    EXPECT_EQ(statOf(dir / to).st_mtim.tv_sec, 4000 + i);
+  }
+  for (int i = 0; i + 1 < kDirectories; i += 2) {
+    const struct stat again = statOf(dir / ("copy" + directoryName(i + 1).substr(4) + "/again"));
+    EXPECT_EQ(again.st_ino, statOf(dir / ("copy" + directoryName(i).substr(4) + "/7")).st_ino);
+    EXPECT_EQ(again.st_nlink, 2u);
+  }
+  EXPECT_EQ(statOf(dir / "copy").st_mtim.tv_sec, 5000);
+  for (int i = 0; i < kDirectories; ++i) {
+    EXPECT_EQ(::chmod((dir / ("copy" + directoryName(i).substr(4))).c_str(), 0755), 0);
+  }
+  EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
+  EXPECT_EQ(names(""), (std::vector<std::string>{"tree"}));
+}
+
+TEST_F(LinuxFileManagerTwoThreadsTest, OnAFullDiskNothingOfTheTreeStaysAndTheSourceIsWhole) {
+  dir.directory("disk");
+  inPrivateMounts([&] {
+    for (const int kibibytes : {200, 1000, 2500, 3500}) {  // it takes 4 KiB a file, and some
+      mountSmallDisk(dir / "disk", kibibytes);
+      EXPECT_EQ(copy("tree", "disk/copy"), failure(ENOSPC)) << kibibytes;
+      EXPECT_EQ(move("tree", "disk/copy"), failure(ENOSPC)) << kibibytes;
+      EXPECT_TRUE(names("disk").empty()) << kibibytes;
+    }
+    for (int i = 0; i < kDirectories; ++i) {
+      EXPECT_EQ(names(directoryName(i)).size(), static_cast<std::size_t>(kFilesEach + 1 + i % 2)) << i;
+    }
+  });
+}
+
+TEST_F(LinuxFileManagerTwoThreadsTest, AMoveToAnotherMountTakesEverything) {
+  dir.directory("disk");
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 16 << 10);
+    EXPECT_EQ(move("tree", "disk/copy"), kSuccess);
+    EXPECT_FALSE(isThere(dir / "tree"));
+    for (int i = 0; i < kDirectories; ++i) {
+      const std::string there = "disk/copy" + directoryName(i).substr(4);
+      EXPECT_EQ(names(there).size(), static_cast<std::size_t>(kFilesEach + 1 + i % 2)) << i;
+      EXPECT_EQ(statOf(dir / there).st_mtim.tv_sec, 4000 + i);
+    }
+  });
+  EXPECT_FALSE(isThere(dir / "tree"));
+}
+
+TEST_F(LinuxFileManagerTwoThreadsTest, WhatCannotBeRemovedIsPassedOverAndItsDirectoriesStay) {
+  if (::geteuid() != 0) GTEST_SKIP() << "mounts on what it removes";
+  inPrivateMounts([&] {
+    const std::string held = dir / (directoryName(5) + "/7");
+    ASSERT_EQ(::mount((dir / (directoryName(4) + "/1")).c_str(), held.c_str(), nullptr, MS_BIND, nullptr), 0);
+    EXPECT_EQ(files.removeItem(dir / "tree"), failure(EBUSY));
+    EXPECT_EQ(names("tree"), (std::vector<std::string>{"deep"}));
+    EXPECT_EQ(names("tree/deep/er"), (std::vector<std::string>{"5"}));
+    EXPECT_EQ(names(directoryName(5)), (std::vector<std::string>{"7"}));
+  });
+}
+
 TEST_F(LinuxFileManagerTest, LargeAndSparseFilesAreCopiedByteForByte) {
   std::string large(3'000'001, '\0');
   for (std::size_t i = 0; i < large.size(); ++i) large[i] = static_cast<char>(i * 2654435761u >> 13);

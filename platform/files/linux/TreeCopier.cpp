@@ -6,16 +6,17 @@
 #include <fcntl.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <climits>
+#include <memory>
+#include <mutex>
 #include <new>
-#include <system_error>
-#include <thread>
+#include <utility>
 
 #include "platform/files/linux/DirectoryNames.h"
 #include "platform/files/linux/HeldDirectory.h"
+#include "platform/files/linux/SecondThread.h"
 
 namespace brenvik {
 namespace {
@@ -25,27 +26,148 @@ constexpr int kOpenDirectory = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 constexpr int kOpenFile = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
 constexpr int kMakeFile = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
 
-// From this number of files on, starting a thread costs less than it saves.
-constexpr std::size_t kWorthAThread = 64;
-
 }  // namespace
+
+// What the threads of one copy share.
+class TreeCopier::Crew {
+ public:
+  Crew(TreeCopier& owner, FileContents& contents) : owner_(owner), contents_(contents) {}
+  Crew(const Crew&) = delete;
+  Crew& operator=(const Crew&) = delete;
+  ~Crew() { fail(ECANCELED); }  // the walk gave up, unless everything is done
+
+  SecondThread& second() { return second_; }
+  TreeCopier& owner() const { return owner_; }
+  // Of the thread; the second one's are made when it needs them.
+  FileContents& contents(bool isOnSecondThread) {
+    if (!isOnSecondThread) return contents_;
+    if (!secondContents_) secondContents_ = std::make_unique<FileContents>();
+    return *secondContents_;
+  }
+
+  // 0 or the first errno; then nothing more is begun.
+  int error() const { return error_.load(std::memory_order_relaxed); }
+  void fail(int code) {
+    int none = 0;
+    error_.compare_exchange_strong(none, code, std::memory_order_relaxed);
+  }
+
+  // A file with several names, which the second thread has met: the first one knows the others.
+  void putAside(std::shared_ptr<Directory> directory, const char* name) {
+    const std::lock_guard lock(mutex_);
+    putAside_.emplace_back(std::move(directory), name);
+  }
+  void copyPutAside();
+
+ private:
+  TreeCopier& owner_;
+  FileContents& contents_;
+  std::unique_ptr<FileContents> secondContents_;
+  std::atomic<int> error_{0};
+  std::mutex mutex_;
+  std::vector<std::pair<std::shared_ptr<Directory>, const char*>> putAside_;
+  SecondThread second_;
+};
+
+// One directory of the walk. Its files may be handed over; then it gets its attributes from whichever thread
+// does its last part: writing into it changes its times, and it may become read-only.
+class TreeCopier::Directory final : public DirectoryWork, public std::enable_shared_from_this<Directory> {
+ public:
+  Directory(Crew& crew, const struct stat& info, FileContents::Owner owner, std::string path)
+      : crew_(crew), info_(info), owner_(owner), path_(std::move(path)) {}
+
+  DirectoryNames names;
+  std::vector<const char*> fileNames;
+
+  const std::string& path() const { return path_; }  // below the top
+  bool isHandedOver() const { return source_.isValid(); }
+
+  // Takes descriptors of its own: the walk may give its own up before the files are done. 0 or errno.
+  int prepareHandingOver(int source, int destination) {
+    source_.reset(::fcntl(source, F_DUPFD_CLOEXEC, 0));
+    destination_.reset(::fcntl(destination, F_DUPFD_CLOEXEC, 0));
+    unfinished_ = fileNames.size() + 1;
+    return source_.isValid() && destination_.isValid() ? 0 : errno;
+  }
+  // The walk will make nothing more in it.
+  int walked(int source, int destination) {
+    if (!isHandedOver()) return crew_.contents(false).copyAttributes(source, info_, destination, owner_);
+    finishParts(1, crew_.contents(false));
+    return crew_.error();
+  }
+
+  std::size_t files() const noexcept override { return fileNames.size(); }
+  void work(bool isOnSecondThread) noexcept override {
+    try {
+      copyFiles(isOnSecondThread);
+    } catch (const std::bad_alloc&) {
+      crew_.fail(ENOMEM);
+    }
+  }
+  void copySeveral(const char* name) {
+    if (crew_.error() != 0) return;
+    const int error = crew_.owner().copyAgain(source_.get(), destination_.get(), name, path_);
+    if (error != 0) return crew_.fail(error);
+    finishParts(1, crew_.contents(false));
+  }
+
+ private:
+  void copyFiles(bool isOnSecondThread) {
+    FileContents& contents = crew_.contents(isOnSecondThread);
+    std::size_t done = 0;
+    for (;;) {
+      const std::size_t mine = next_.fetch_add(1, std::memory_order_relaxed);
+      if (mine >= fileNames.size() || crew_.error() != 0) break;
+      const char* const name = fileNames[mine];
+      bool hasSeveralNames = false;
+      const int error =
+          crew_.owner().copyRegular(contents, source_.get(), destination_.get(), name, &hasSeveralNames);
+      if (error != 0) return crew_.fail(error);
+      if (!hasSeveralNames) {
+        ++done;
+      } else if (isOnSecondThread) {
+        crew_.putAside(shared_from_this(), name);
+      } else {
+        copySeveral(name);
+      }
+    }
+    if (done > 0) finishParts(done, contents);
+  }
+  void finishParts(std::size_t parts, FileContents& contents) {
+    // Acquire and release: what the other thread made in the directory comes before its attributes.
+    if (unfinished_.fetch_sub(parts, std::memory_order_acq_rel) != parts) return;
+    const int error = contents.copyAttributes(source_.get(), info_, destination_.get(), owner_);
+    if (error != 0) crew_.fail(error);
+  }
+
+  Crew& crew_;
+  const struct stat info_;
+  const FileContents::Owner owner_;
+  const std::string path_;
+  UniqueFd source_;
+  UniqueFd destination_;
+  std::atomic<std::size_t> next_{0};
+  std::atomic<std::size_t> unfinished_{0};  // files, and the walk
+};
 
 struct TreeCopier::Level {
   HeldDirectory source;
   HeldDirectory destination;
-  struct stat info {};
-  DirectoryNames names;
-  std::size_t pathLength = 0;  // of the path down to this level
+  std::shared_ptr<Directory> directory;
 };
 
-// The files of one directory, handed out one by one to whoever asks next.
-struct TreeCopier::Share {
-  int from;
-  int to;
-  std::vector<const char*> names;
-  std::atomic<std::size_t> next{0};
-  std::atomic<bool> failed{false};
-};
+void TreeCopier::Crew::copyPutAside() {
+  for (;;) {
+    std::pair<std::shared_ptr<Directory>, const char*> one;
+    {
+      const std::lock_guard lock(mutex_);
+      if (putAside_.empty()) return;
+      one = std::move(putAside_.back());
+      putAside_.pop_back();
+    }
+    one.first->copySeveral(one.second);
+  }
+}
 
 void TreeCopier::learnUmask(int directory) {
   // umask(2) can only be read by changing it, for all threads.
@@ -105,107 +227,81 @@ int TreeCopier::copyRegular(FileContents& contents, int from, int to, const char
                                  modeFits ? FileContents::Mode::asCreated : FileContents::Mode::asSource);
 }
 
-int TreeCopier::workOn(Share& share, FileContents& contents, std::vector<const char*>* severalNames) const {
-  while (!share.failed.load(std::memory_order_relaxed)) {
-    const std::size_t mine = share.next.fetch_add(1, std::memory_order_relaxed);
-    if (mine >= share.names.size()) return 0;
-    bool hasSeveralNames = false;
-    const char* const name = share.names[mine];
-    if (const int error = copyRegular(contents, share.from, share.to, name, &hasSeveralNames); error != 0) {
-      share.failed.store(true, std::memory_order_relaxed);
-      return error;
-    }
-    if (hasSeveralNames) severalNames->push_back(name);
-  }
-  return 0;
-}
-
 // Copies a file or another item that may have been copied already under another name.
-int TreeCopier::copyAgain(int from, int to, const char* name, const std::string& pathHere, int top) {
+int TreeCopier::copyAgain(int from, int to, const char* name, const std::string& pathHere) {
   struct stat info {};
   if (::fstatat(from, name, &info, AT_SYMLINK_NOFOLLOW) != 0) return errno;
   if (info.st_nlink > 1) {
     const auto [known, isFirst] =
         linked_.try_emplace({info.st_dev, info.st_ino}, pathHere.empty() ? name : pathHere + "/" + name);
     // Where a second name cannot be had, a second copy has the same content.
-    if (!isFirst && ::linkat(top, known->second.c_str(), to, name, 0) == 0) return 0;
+    if (!isFirst && ::linkat(top_, known->second.c_str(), to, name, 0) == 0) return 0;
   }
   return S_ISREG(info.st_mode) ? copyRegular(contents_, from, to, name, nullptr)
                                : copySpecial(from, name, info, to, name);
 }
 
-int TreeCopier::copyEntries(Level& level, const std::string& pathHere, int top) {
-  Share share{level.source.get(), level.destination.get(), {}};
+int TreeCopier::copyEntries(Level& level, Crew& crew) {
+  const std::shared_ptr<Directory>& directory = level.directory;
+  const int from = level.source.get();
+  const int to = level.destination.get();
+  if (const int error = directory->names.load(from); error != 0) return error;
   std::vector<const char*> others;
-  for (DirectoryNames::Entry entry{}; level.names.next(&entry);) {
+  for (DirectoryNames::Entry entry{}; directory->names.next(&entry);) {
     if (entry.type == DT_REG) {
-      share.names.push_back(entry.name);
+      directory->fileNames.push_back(entry.name);
     } else if (entry.type != DT_DIR) {
       others.push_back(entry.name);
     }
   }
-  level.names.rewind();
-
-  int helperError = 0;
-  std::vector<const char*> helperOthers;
-  std::thread helper;
-  if (share.names.size() >= kWorthAThread && std::thread::hardware_concurrency() > 1) {
-    try {
-      helper = std::thread([this, &share, &helperOthers, &helperError]() noexcept {
-        try {
-          FileContents contents;
-          helperError = workOn(share, contents, &helperOthers);
-        } catch (const std::bad_alloc&) {
-          helperError = ENOMEM;
-        }
-      });
-    } catch (const std::system_error&) {  // no thread to be had: this one does it all
+  directory->names.rewind();
+  if (crew.second().isWorth(directory->fileNames.size())) {
+    if (const int error = directory->prepareHandingOver(from, to); error != 0) return error;
+    crew.second().handOver(directory);
+  } else {
+    for (const char* name : directory->fileNames) {
+      bool hasSeveralNames = false;
+      const int error = copyRegular(contents_, from, to, name, &hasSeveralNames);
+      if (error != 0) return error;
+      if (hasSeveralNames) others.push_back(name);
     }
   }
-  int error = 0;
-  try {
-    error = workOn(share, contents_, &others);
-  } catch (const std::bad_alloc&) {
-    error = ENOMEM;
-    share.failed = true;
-  }
-  if (helper.joinable()) helper.join();
-  if (error == 0) error = helperError;
-  if (error != 0) return error;
-  others.insert(others.end(), helperOthers.begin(), helperOthers.end());
   for (const char* name : others) {
-    if (const int failed = copyAgain(share.from, share.to, name, pathHere, top); failed != 0) return failed;
+    if (const int error = copyAgain(from, to, name, directory->path()); error != 0) return error;
   }
-  return 0;
+  crew.copyPutAside();
+  return crew.error();
 }
 
 int TreeCopier::copyDirectoryInto(int source, const struct stat& info, int destination) {
   linked_.clear();
+  top_ = destination;
   learnUmask(destination);
+  Crew crew(*this, contents_);
   std::vector<Level> levels;
-  std::string path;
-  const auto enter = [&](UniqueFd from, UniqueFd to, const struct stat& about) {
+  const auto enter = [&](UniqueFd from, UniqueFd to, const struct stat& about, std::string path) {
     if (levels.size() >= kHeldLevels) {
       Level& far = levels[levels.size() - kHeldLevels];
       if (const int error = far.source.giveUp(); error != 0) return error;
       if (const int error = far.destination.giveUp(); error != 0) return error;
     }
-    levels.push_back({HeldDirectory(std::move(from)), HeldDirectory(std::move(to)), about, {}, path.size()});
-    Level& level = levels.back();
-    if (const int error = level.names.load(level.source.get()); error != 0) return error;
-    return copyEntries(level, path, destination);
+    const bool ownerFits = !levels.empty() && about.st_uid == ownUid_ && about.st_gid == ownGid_;
+    const auto owner = ownerFits ? FileContents::Owner::asCreated : FileContents::Owner::asSource;
+    levels.push_back({HeldDirectory(std::move(from)), HeldDirectory(std::move(to)),
+                      std::make_shared<Directory>(crew, about, owner, std::move(path))});
+    return copyEntries(levels.back(), crew);
   };
   {
     UniqueFd from(::openat(source, ".", kOpenDirectory));
     UniqueFd to(::openat(destination, ".", kOpenDirectory));
     if (!from.isValid() || !to.isValid()) return errno;
-    if (const int error = enter(std::move(from), std::move(to), info); error != 0) return error;
+    if (const int error = enter(std::move(from), std::move(to), info, {}); error != 0) return error;
   }
   while (!levels.empty()) {
     Level& level = levels.back();
     DirectoryNames::Entry entry{};
-    bool more = level.names.next(&entry);
-    while (more && entry.type != DT_DIR) more = level.names.next(&entry);
+    bool more = level.directory->names.next(&entry);
+    while (more && entry.type != DT_DIR) more = level.directory->names.next(&entry);
     if (more) {
       struct stat about {};
       UniqueFd from(::openat(level.source.get(), entry.name, kOpenDirectory));
@@ -213,29 +309,27 @@ int TreeCopier::copyDirectoryInto(int source, const struct stat& info, int desti
       if (::mkdirat(level.destination.get(), entry.name, 0700) != 0) return errno;
       UniqueFd to(::openat(level.destination.get(), entry.name, kOpenDirectory));
       if (!to.isValid()) return errno;
-      path.resize(level.pathLength);
+      std::string path = level.directory->path();
       if (!path.empty()) path += '/';
       path += entry.name;
-      if (const int error = enter(std::move(from), std::move(to), about); error != 0) return error;
+      const int error = enter(std::move(from), std::move(to), about, std::move(path));
+      if (error != 0) return error;
       continue;
-    }
-    // Attributes last: writing into the directory changed its times, and it may become read-only.
-    const bool isTop = levels.size() == 1;
-    const bool ownerFits = !isTop && level.info.st_uid == ownUid_ && level.info.st_gid == ownGid_;
-    if (const int error = contents_.copyAttributes(
-            level.source.get(), level.info, level.destination.get(),
-            ownerFits ? FileContents::Owner::asCreated : FileContents::Owner::asSource);
-        error != 0) {
-      return error;
     }
     const Level done = std::move(levels.back());
     levels.pop_back();
-    if (levels.empty()) break;
-    if (const int error = levels.back().source.takeAgain(done.source.get()); error != 0) return error;
-    if (const int error = levels.back().destination.takeAgain(done.destination.get()); error != 0)
-      return error;
+    if (!levels.empty()) {
+      // Before the directory may become one that cannot be left by "..".
+      if (const int error = levels.back().source.takeAgain(done.source.get()); error != 0) return error;
+      const int error = levels.back().destination.takeAgain(done.destination.get());
+      if (error != 0) return error;
+    }
+    const int error = done.directory->walked(done.source.get(), done.destination.get());
+    if (error != 0) return error;
   }
-  return 0;
+  crew.second().drain();
+  crew.copyPutAside();
+  return crew.error();
 }
 
 }  // namespace brenvik

@@ -35,20 +35,20 @@ class TreeCopier {
                   const char* destinationName);
 
  private:
+  class Directory;
   struct Level;
-  struct Share;
+  class Crew;
 
   void learnUmask(int directory);
-  // What both threads run: copies files of the share until there are none left or one failed.
-  int workOn(Share& share, FileContents& contents, std::vector<const char*>* severalNames) const;
   int copyRegular(FileContents& contents, int from, int to, const char* name, bool* hasSeveralNames) const;
-  int copyAgain(int from, int to, const char* name, const std::string& pathHere, int top);
-  // Everything in the level's directory but the directories.
-  int copyEntries(Level& level, const std::string& pathHere, int top);
+  int copyAgain(int from, int to, const char* name, const std::string& pathHere);
+  // Everything in the level's directory but the directories, unless its files are handed over.
+  int copyEntries(Level& level, Crew& crew);
 
   FileContents& contents_;
   const uid_t ownUid_;
   const gid_t ownGid_;
+  int top_ = -1;                                           // where directories are copied to
   mode_t umask_ = 0777;                                    // what creation takes from a mode
   std::map<std::pair<dev_t, ino_t>, std::string> linked_;  // files with several names: the first copy's path
 };

@@ -8,51 +8,156 @@
 
 #include <atomic>
 #include <cerrno>
+#include <memory>
 #include <string>
-#include <system_error>
-#include <thread>
+#include <utility>
 #include <vector>
 
 #include "platform/files/linux/DirectoryNames.h"
 #include "platform/files/linux/HeldDirectory.h"
+#include "platform/files/linux/SecondThread.h"
 
 namespace brenvik {
 namespace {
 
-struct Level {
-  HeldDirectory directory;
-  DirectoryNames names;
-  std::string name;  // in the level above
+constexpr int kOpenFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+
+// One of the errors met, by whichever thread.
+class FirstError {
+ public:
+  void remember(int error) {
+    int none = 0;
+    error_.compare_exchange_strong(none, error, std::memory_order_relaxed);
+  }
+  int get() const { return error_.load(std::memory_order_relaxed); }
+
+ private:
+  std::atomic<int> error_{0};
 };
 
-// From this number of files on, starting a thread costs less than it saves.
-constexpr std::size_t kWorthAThread = 64;
+// What is in a directory; everything but the directories may be handed over.
+class Contents final : public DirectoryWork {
+ public:
+  explicit Contents(FirstError& error) : error_(error) {}
 
-// Removes the files of one directory, two at a time where they are many. 0, or one of the errors met.
-int removeAll(int directory, const std::vector<const char*>& files) {
-  std::atomic<std::size_t> next{0};
-  const auto work = [&]() noexcept {
-    int first = 0;
-    for (;;) {
-      const std::size_t mine = next.fetch_add(1, std::memory_order_relaxed);
-      if (mine >= files.size()) return first;
-      if (::unlinkat(directory, files[mine], 0) != 0 && errno != ENOENT && first == 0) first = errno;
+  DirectoryNames names;
+
+  // 0 or errno; may throw std::bad_alloc.
+  int load(int directory) {
+    if (const int error = names.load(directory); error != 0) return error;
+    for (DirectoryNames::Entry entry{}; names.next(&entry);) {
+      if (entry.type != DT_DIR) fileNames_.push_back(entry.name);
     }
-  };
-  int helperError = 0;
-  std::thread helper;
-  if (files.size() >= kWorthAThread && std::thread::hardware_concurrency() > 1) {
-    try {
-      helper = std::thread([&]() noexcept { helperError = work(); });
-    } catch (const std::system_error&) {  // no thread to be had: this one does it all
+    names.rewind();
+    return 0;
+  }
+  bool isHandedOver() const { return directory_.isValid(); }
+  // A descriptor of its own: the walk may give its own up before the files are gone.
+  bool prepareHandingOver(int directory) {
+    directory_.reset(::fcntl(directory, F_DUPFD_CLOEXEC, 0));
+    return directory_.isValid();
+  }
+
+  std::size_t files() const noexcept override { return fileNames_.size(); }
+  void work(bool) noexcept override { removeFiles(directory_.get()); }
+  void removeFiles(int directory) noexcept {
+    for (;;) {
+      const std::size_t mine = next_.fetch_add(1, std::memory_order_relaxed);
+      if (mine >= fileNames_.size()) return;
+      if (::unlinkat(directory, fileNames_[mine], 0) != 0 && errno != ENOENT) error_.remember(errno);
     }
   }
-  const int error = work();
-  if (helper.joinable()) helper.join();
-  return error != 0 ? error : helperError;
-}
 
-constexpr int kOpenFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+ private:
+  FirstError& error_;
+  std::vector<const char*> fileNames_;
+  UniqueFd directory_;
+  std::atomic<std::size_t> next_{0};
+};
+
+struct Level {
+  HeldDirectory directory;
+  std::shared_ptr<Contents> contents;
+  std::string name;                // in the level above
+  std::vector<std::string> later;  // directories to remove when the files that were handed over are gone
+};
+
+class Walk {
+ public:
+  explicit Walk(int above) : above_(above) {}
+
+  int enter(int parent, const char* name) {
+    UniqueFd fd(::openat(parent, name, kOpenFlags));
+    if (!fd.isValid()) return errno;
+    auto contents = std::make_shared<Contents>(error_);
+    if (const int error = contents->load(fd.get()); error != 0) return error;
+    if (levels_.size() >= kHeldLevels) {
+      if (const int error = levels_[levels_.size() - kHeldLevels].directory.giveUp(); error != 0)
+        return error;
+    }
+    const int here = fd.get();
+    levels_.push_back({HeldDirectory(std::move(fd)), contents, name, {}});
+    if (second_.isWorth(contents->files()) && contents->prepareHandingOver(here)) {
+      second_.handOver(std::move(contents));
+    } else {
+      contents->removeFiles(here);
+    }
+    return 0;
+  }
+
+  // 0, or the first errno.
+  int run() {
+    while (!levels_.empty()) {
+      Level& level = levels_.back();
+      DirectoryNames::Entry entry{};
+      if (level.contents->names.next(&entry)) {
+        if (entry.type == DT_DIR) enterOrRemove(level.directory.get(), entry.name);
+      } else if (!leave()) {
+        return error_.get();  // the way up is gone: nothing more can be removed safely
+      }
+    }
+    return error_.get();
+  }
+
+ private:
+  void enterOrRemove(int parent, const char* name) {
+    if (const int error = enter(parent, name); error != 0) {
+      // Not readable, but perhaps empty; or gone, or no directory any more.
+      if (::unlinkat(parent, name, AT_REMOVEDIR) != 0 && errno != ENOENT) error_.remember(error);
+    }
+  }
+
+  void removeDirectory(int parent, const std::string& name) {
+    if (::unlinkat(parent, name.c_str(), AT_REMOVEDIR) != 0) error_.remember(errno);
+  }
+
+  bool leave() {
+    const Level done = std::move(levels_.back());
+    levels_.pop_back();
+    if (!done.later.empty()) second_.drain();
+    for (const std::string& name : done.later) removeDirectory(done.directory.get(), name);
+    int above = above_;
+    if (!levels_.empty()) {
+      if (const int error = levels_.back().directory.takeAgain(done.directory.get()); error != 0) {
+        error_.remember(error);
+        return false;
+      }
+      above = levels_.back().directory.get();
+    }
+    if (done.contents->isHandedOver() && !levels_.empty()) {
+      levels_.back().later.push_back(done.name);
+      return true;
+    }
+    if (done.contents->isHandedOver()) second_.drain();
+    removeDirectory(above, done.name);
+    return true;
+  }
+
+  const int above_;
+  FirstError error_;
+  std::vector<Level> levels_;
+  SecondThread second_;
+};
 
 }  // namespace
 
@@ -61,63 +166,13 @@ int removeTree(int directory, const char* name) {
   // EISDIR is Linux's answer for a directory, EPERM the one of POSIX.
   if (errno != EISDIR && errno != EPERM) return errno;
   const int unlinkError = errno;
-  int first = 0;
-  const auto remember = [&first](int error) {
-    if (first == 0) first = error;
-  };
-  std::vector<Level> levels;
-  // Everything in the level's directory but the directories, which are left for the walk.
-  const auto removeFiles = [&remember](Level& level) {
-    std::vector<const char*> files;
-    for (DirectoryNames::Entry entry{}; level.names.next(&entry);) {
-      if (entry.type != DT_DIR) files.push_back(entry.name);
-    }
-    level.names.rewind();
-    remember(removeAll(level.directory.get(), files));
-  };
-  const auto enter = [&](int parent, const char* child) {
-    UniqueFd fd(::openat(parent, child, kOpenFlags));
-    if (!fd.isValid()) return errno;
-    Level level{HeldDirectory(std::move(fd)), {}, child};
-    if (const int error = level.names.load(level.directory.get()); error != 0) return error;
-    if (levels.size() >= kHeldLevels) {
-      if (const int error = levels[levels.size() - kHeldLevels].directory.giveUp(); error != 0) return error;
-    }
-    levels.push_back(std::move(level));
-    removeFiles(levels.back());
-    return 0;
-  };
-
-  if (const int error = enter(directory, name); error != 0) {
+  Walk walk(directory);
+  if (const int error = walk.enter(directory, name); error != 0) {
     // Not readable, but perhaps empty; or no directory at all, and the first answer stands.
     if (::unlinkat(directory, name, AT_REMOVEDIR) == 0) return 0;
     return error == ENOTDIR || error == ELOOP ? unlinkError : error;
   }
-  while (!levels.empty()) {
-    Level& level = levels.back();
-    DirectoryNames::Entry entry{};
-    if (level.names.next(&entry)) {
-      const int here = level.directory.get();
-      if (entry.type != DT_DIR) continue;
-      if (const int error = enter(here, entry.name); error != 0) {
-        // Not readable, but perhaps empty; or gone, or no directory any more.
-        if (::unlinkat(here, entry.name, AT_REMOVEDIR) != 0 && errno != ENOENT) remember(error);
-      }
-      continue;
-    }
-    const Level done = std::move(levels.back());
-    levels.pop_back();
-    int above = directory;
-    if (!levels.empty()) {
-      if (const int error = levels.back().directory.takeAgain(done.directory.get()); error != 0) {
-        remember(error);
-        return first;  // the way up is gone: nothing more can be removed safely
-      }
-      above = levels.back().directory.get();
-    }
-    if (::unlinkat(above, done.name.c_str(), AT_REMOVEDIR) != 0) remember(errno);
-  }
-  return first;
+  return walk.run();
 }
 
 }  // namespace brenvik
