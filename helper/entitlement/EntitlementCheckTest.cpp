@@ -385,7 +385,7 @@ class ObservedQueues final : public WorkQueues {
  public:
   explicit ObservedQueues(WorkQueues& real) : real_(real) {}
   WorkQueue& main() noexcept override { return real_.main(); }
-  WorkQueue& global() noexcept override { return real_.global(); }
+  WorkQueue& global() override { return real_.global(); }
   std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
     return real_.makeSerial(std::move(label), qualityOfService);
   }
@@ -420,6 +420,15 @@ class RealProcessTest : public testing::Test {
     security.grant(caller, kName, PropertyList::boolean(true));
   }
   void TearDown() override { endChild(); }
+  // The main loop notices an exit, the global queue handles it.
+  bool exitIsHandled() {
+    const auto future = queues.handled->get_future();
+    for (int i = 0; i < 30; ++i) {
+      (void)loop->run(std::chrono::milliseconds(100), ReturnAfterSource::no);
+      if (future.wait_for(std::chrono::milliseconds(900)) == std::future_status::ready) return true;
+    }
+    return false;
+  }
   void endChild() {
     if (child <= 0) return;
     ::kill(child, SIGKILL);
@@ -440,7 +449,7 @@ TEST_F(RealProcessTest, AGrantIsForgottenWhenItsProcessExits) {
   EXPECT_EQ(check.grants(), 1U);
   EXPECT_EQ(check.watchers(), 1U);
   endChild();
-  ASSERT_EQ(queues.handled->get_future().wait_for(std::chrono::seconds(30)), std::future_status::ready);
+  ASSERT_TRUE(exitIsHandled());
   EXPECT_EQ(check.grants(), 0U);
   EXPECT_EQ(check.watchers(), 0U);
 }
@@ -448,7 +457,7 @@ TEST_F(RealProcessTest, AGrantIsForgottenWhenItsProcessExits) {
 TEST_F(RealProcessTest, AProcessThatExitsWhileItIsBeingGrantedIsForgottenAtOnce) {
   security.whileAsked = [this] { endChild(); };
   EXPECT_TRUE(check.HasEntitlement(kName, caller)) << "it was there when the service answered";
-  ASSERT_EQ(queues.handled->get_future().wait_for(std::chrono::seconds(30)), std::future_status::ready);
+  ASSERT_TRUE(exitIsHandled());
   EXPECT_EQ(check.grants(), 0U);
   EXPECT_EQ(check.watchers(), 0U);
 }

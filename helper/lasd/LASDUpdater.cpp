@@ -3,6 +3,7 @@
 #include "helper/lasd/LASDUpdater.h"
 
 #include <exception>
+#include <new>
 #include <string_view>
 #include <utility>
 
@@ -51,9 +52,14 @@ void LASDUpdater::checkForUpdate(ServerContext& server, std::uint32_t mask) {
   const std::weak_ptr<LASDUpdater> weak = weak_from_this();
   auto self = weak.lock();
   if (self == nullptr) std::terminate();
-  // Made here and not before, so that a process which never needs it does not pay for it.
-  if (queue_ == nullptr) queue_ = parts_->queues.makeSerial(kQueueLabel, QualityOfService::standard);
-  queue_->post([self = std::move(self), &server, mask, token] { self->check(server, mask, token); });
+  try {
+    // Made here and not before, so that a process which never needs it does not pay for it.
+    if (queue_ == nullptr) queue_ = parts_->queues.makeSerial(kQueueLabel, QualityOfService::standard);
+    queue_->post([self = std::move(self), &server, mask, token] { self->check(server, mask, token); });
+  } catch (const std::bad_alloc&) {
+    (void)ReleaseBusyToken(server, token);  // one bit, as it was given: no check will do it
+    throw;
+  }
 }
 
 void LASDUpdater::check(ServerContext& server, std::uint32_t mask, std::uint32_t token) {

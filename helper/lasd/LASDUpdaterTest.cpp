@@ -198,6 +198,12 @@ TEST_F(LASDUpdaterTest, TheRequestReturnsAtOnceAndTheWorkIsDoneOnTheUpdatersQueu
   EXPECT_NE(server.idleTimer, nullptr) << "no client and no token: the countdown begins";
 }
 
+TEST_F(LASDUpdaterTest, ACheckThatFindsNoQueueLeavesNoTokenBehind) {
+  queues.refuseQueues = true;
+  EXPECT_THROW(updater->checkForUpdate(server, 1), std::bad_alloc);
+  EXPECT_EQ(server.busyMask, 0U);
+}
+
 TEST_F(LASDUpdaterTest, Mask0ReadsNoPreferenceAndStillFetchesTheManifest) {
   serveAll("1.0");
   check(0);

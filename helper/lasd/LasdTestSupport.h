@@ -46,8 +46,9 @@ inline std::string contentOf(const std::filesystem::path& path) {
 class LasdTestQueues final : public WorkQueues {
  public:
   WorkQueue& main() noexcept override { return system_.main(); }
-  WorkQueue& global() noexcept override { return system_.global(); }
+  WorkQueue& global() override { return system_.global(); }
   std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
+    if (refuseQueues) throw OutOfQueues();
     made.emplace_back(label, qualityOfService);
     if (label != "LASDUpdater") return system_.makeSerial(std::move(label), qualityOfService);
     updater = std::make_shared<ManualWorkQueue>(clock_, std::move(label), qualityOfService);
@@ -61,6 +62,7 @@ class LasdTestQueues final : public WorkQueues {
 
   std::vector<std::pair<std::string, QualityOfService>> made;
   std::shared_ptr<ManualWorkQueue> updater;
+  bool refuseQueues = false;
 
  private:
   ManualClock clock_;

@@ -304,7 +304,7 @@ TEST_F(LocationRoutinesTest, AnExceptionWhileQueueingARequestEndsTheProcess) {
    public:
     explicit QueuesWithoutMemory(ManualWorkQueues& others) : others_(others) {}
     WorkQueue& main() noexcept override { return others_.main(); }
-    WorkQueue& global() noexcept override { return others_.global(); }
+    WorkQueue& global() override { return others_.global(); }
     std::shared_ptr<WorkQueue> makeSerial(std::string, QualityOfService) override { throw std::bad_alloc(); }
     std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t, std::uint32_t, WorkQueue::Task,
                                                              WorkQueue::Task) override {

@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <new>
 #include <string>
 
 #include "platform/runloop/RunLoop.h"
@@ -66,6 +67,13 @@ class ProcessExitSource {
   virtual void cancel() noexcept = 0;
 };
 
+// The system has no descriptor, thread or memory left for a queue. A kind of bad_alloc: whoever copes with
+// lack of memory copes with this.
+class OutOfQueues : public std::bad_alloc {
+ public:
+  const char* what() const noexcept override { return "no descriptor or thread is left for a work queue"; }
+};
+
 // Makes queues. Any thread.
 class WorkQueues {
  public:
@@ -74,15 +82,16 @@ class WorkQueues {
   // The queue served by the main thread's run loop.
   virtual WorkQueue& main() noexcept = 0;
 
-  // The process-wide default-priority queue for short handlers.
-  virtual WorkQueue& global() noexcept = 0;
+  // The process-wide default-priority queue for short handlers. Throws OutOfQueues.
+  virtual WorkQueue& global() = 0;
 
-  // A new serial queue; its thread starts with its first task. Never null.
+  // A new serial queue; its thread starts with its first task. Never null, and never a queue that shares its
+  // thread with another: throws OutOfQueues, as the posting of the first task may.
   virtual std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) = 0;
 
   // Watches the process `pid` whose start time (field 22 of /proc/PID/stat, low 32 bits) is `startTime`. The
-  // event handler runs on global(); at once when that process is gone already or the id names another one.
-  // Null when the kernel gives no descriptor for it.
+  // event handler runs on global(), once the main run loop runs; at once when that process is gone already or
+  // the id names another one. Null when the kernel gives no descriptor for it.
   virtual std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t startTime,
                                                                    WorkQueue::Task onExit,
                                                                    WorkQueue::Task onCancel) = 0;

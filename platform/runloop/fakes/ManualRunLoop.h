@@ -163,7 +163,7 @@ class ManualWorkQueues final : public WorkQueues {
       : clock_(clock), main_(clock, "main"), global_(clock, "global") {}
 
   ManualWorkQueue& main() noexcept override { return main_; }
-  ManualWorkQueue& global() noexcept override { return global_; }
+  ManualWorkQueue& global() override { return global_; }
   std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
     auto queue = std::make_shared<ManualWorkQueue>(clock_, std::move(label), qualityOfService);
     serial.push_back(queue);

@@ -98,8 +98,9 @@ class EventLoop::Descriptor final : public DescriptorSource {
   const std::shared_ptr<State> state_;
 };
 
-std::shared_ptr<EventLoop> EventLoop::make() {
+std::shared_ptr<EventLoop> EventLoop::make(For whom) {
   std::shared_ptr<EventLoop> loop(new EventLoop);
+  if (whom == For::thisThread) loop->thread_ = std::this_thread::get_id();
   sd_event* event = nullptr;
   if (sd_event_new(&event) < 0) return nullptr;
   loop->event_.reset(event);
@@ -114,6 +115,13 @@ std::shared_ptr<EventLoop> EventLoop::make() {
   };
   if (sd_event_add_io(event, &source, loop->wakeFd_.get(), EPOLLIN, onWake, loop.get()) < 0) return nullptr;
   loop->wakeSource_.reset(source);
+  if (whom == For::anotherThread) {
+    // The library opens a clock's descriptor for its first timer and keeps it: later might be too late.
+    if (sd_event_add_time(event, &source, kClock, UINT64_MAX, 1, &EventLoop::onTime, nullptr) < 0) {
+      return nullptr;
+    }
+    sd_event_source_disable_unref(source);
+  }
   return loop;
 }
 

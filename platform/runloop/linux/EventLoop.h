@@ -21,12 +21,16 @@ namespace brenvik {
 // One thread's sd_event(3) loop with an inbox that any thread may post to; what the main run loop and every
 // work queue stand on. It wakes for its sources and its inbox and for nothing else.
 //
-// The thread that calls runOnce() is the loop's thread; before the first call, the thread that made the loop
-// is.
+// The thread that calls runOnce() is the loop's thread.
 class EventLoop : public std::enable_shared_from_this<EventLoop> {
  public:
+  // Whose the loop is before its first runOnce(): the maker's own, or another's that will be started. One for
+  // another thread takes all the descriptors it will ever need at once, timers included.
+  enum class For { thisThread, anotherThread };
+  static constexpr int kDescriptorsForAnotherThread = 3;
+
   // Null when the system is out of descriptors or memory.
-  static std::shared_ptr<EventLoop> make();
+  static std::shared_ptr<EventLoop> make(For whom);
   ~EventLoop();
   EventLoop(const EventLoop&) = delete;
   EventLoop& operator=(const EventLoop&) = delete;
@@ -75,7 +79,7 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   std::unique_ptr<sd_event, Unref> event_;
   UniqueFd wakeFd_;
   SourcePointer wakeSource_;
-  std::atomic<std::thread::id> thread_{std::this_thread::get_id()};
+  std::atomic<std::thread::id> thread_;  // none: not started
   std::mutex inboxMutex_;
   std::vector<std::function<void()>> inbox_;
   std::unordered_map<Timer*, std::shared_ptr<Timer>> armed_;  // loop thread only

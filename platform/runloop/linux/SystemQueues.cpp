@@ -10,10 +10,12 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cmath>
+#include <functional>
 #include <mutex>
+#include <system_error>
 #include <thread>
 #include <utility>
+#include <vector>
 
 #include "platform/base/ProcessStartTime.h"
 
@@ -120,12 +122,16 @@ class ThreadQueue final : public SystemQueue {
  protected:
   void start() override {
     std::call_once(started_, [this] {
-      thread_ = std::thread([loop = loop_, quit = quit_, qualityOfService = qualityOfService_] {
-        applyQualityOfService(qualityOfService);
-        while (!quit->load()) {
-          if (loop->runOnce(kNoTimeOut) < 0) break;
-        }
-      });
+      try {
+        thread_ = std::thread([loop = loop_, quit = quit_, qualityOfService = qualityOfService_] {
+          applyQualityOfService(qualityOfService);
+          while (!quit->load()) {
+            if (loop->runOnce(kNoTimeOut) < 0) break;
+          }
+        });
+      } catch (const std::system_error&) {
+        throw OutOfQueues();
+      }
       // The kernel keeps 15 characters.
       (void)::pthread_setname_np(thread_.native_handle(), label().substr(0, 15).c_str());
     });
@@ -138,11 +144,81 @@ class ThreadQueue final : public SystemQueue {
   std::thread thread_;
 };
 
+// Descriptors kept back for queues. Any thread.
+class DescriptorReserve {
+ public:
+  explicit DescriptorReserve(std::size_t count) : kept_(count) { fill(); }
+  // Takes back what is missing, as far as there are descriptors.
+  void fill() noexcept {
+    const std::lock_guard lock(mutex_);
+    for (UniqueFd& fd : kept_) {
+      if (!fd.isValid()) fd.reset(::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, 0));
+    }
+  }
+  // Gives up to `count` descriptors free.
+  void spend(int count) noexcept {
+    const std::lock_guard lock(mutex_);
+    for (UniqueFd& fd : kept_) {
+      if (count == 0) return;
+      if (!fd.isValid()) continue;
+      fd.reset();
+      --count;
+    }
+  }
+
+ private:
+  std::mutex mutex_;
+  std::vector<UniqueFd> kept_;
+};
+
+}  // namespace
+
+// Makes the serial queues and, when it is first wanted, the global one.
+class SystemQueues::Maker {
+ public:
+  Maker() : reserve_(std::make_shared<DescriptorReserve>(kReserved)) {}
+
+  std::shared_ptr<WorkQueue> make(std::string label, QualityOfService qualityOfService) {
+    auto loop = EventLoop::make(EventLoop::For::anotherThread);
+    // Another thread may be faster at taking what the reserve lets go of: as often as it can let go.
+    for (int i = 0; loop == nullptr && i < kReservedQueues; ++i) {
+      reserve_->spend(EventLoop::kDescriptorsForAnotherThread);
+      loop = EventLoop::make(EventLoop::For::anotherThread);
+    }
+    if (loop == nullptr) {
+      reserve_->fill();
+      throw OutOfQueues();
+    }
+    // What the queue gives back goes to the reserve first.
+    const auto destroy = [reserve = reserve_](ThreadQueue* queue) {
+      delete queue;
+      reserve->fill();
+    };
+    return {new ThreadQueue(std::move(loop), std::move(label), qualityOfService), destroy};
+  }
+  WorkQueue& global() {
+    const std::lock_guard lock(mutex_);
+    if (global_ == nullptr) global_ = make("global", QualityOfService::standard);
+    return *global_;
+  }
+
+ private:
+  static constexpr std::size_t kReserved =
+      std::size_t{kReservedQueues} * std::size_t{EventLoop::kDescriptorsForAnotherThread};
+  const std::shared_ptr<DescriptorReserve> reserve_;
+  std::mutex mutex_;
+  std::shared_ptr<WorkQueue> global_;
+};
+
+namespace {
+
 class PidfdExitSource final : public ProcessExitSource {
  public:
-  PidfdExitSource(std::weak_ptr<WorkQueue> queue, UniqueFd pidfd, WorkQueue::Task onExit,
-                  WorkQueue::Task onCancel)
-      : queue_(std::move(queue)), state_(std::make_shared<State>()) {
+  // `onGlobal` runs a task on the global queue, or drops it when there is none any more.
+  PidfdExitSource(const std::shared_ptr<EventLoop>& loop, std::function<void(WorkQueue::Task)> onGlobal,
+                  UniqueFd pidfd, WorkQueue::Task onExit, WorkQueue::Task onCancel)
+      : loop_(loop), state_(std::make_shared<State>()) {
+    state_->onGlobal = std::move(onGlobal);
     state_->pidfd = std::move(pidfd);
     state_->onExit = std::move(onExit);
     state_->onCancel = std::move(onCancel);
@@ -150,13 +226,11 @@ class PidfdExitSource final : public ProcessExitSource {
   ~PidfdExitSource() override { end(false); }
 
   void activate() override {
-    const auto queue = queue_.lock();
-    if (queue == nullptr) return;
-    queue->post([state = state_, weak = queue_] {
-      const auto self = weak.lock();
-      if (state->cancelled.load() || self == nullptr) return;
+    onLoop([state = state_, weak = loop_] {
+      const auto loop = weak.lock();
+      if (state->cancelled.load() || loop == nullptr) return;
       if (!state->pidfd.isValid()) return tell(state);  // it was gone before it could be watched
-      state->source = self->watchDescriptor(state->pidfd.get(), EPOLLIN, [state](std::uint32_t) {
+      state->source = loop->addDescriptor(state->pidfd.get(), EPOLLIN, [state](std::uint32_t) {
         state->source.reset();
         tell(state);
       });
@@ -167,34 +241,45 @@ class PidfdExitSource final : public ProcessExitSource {
  private:
   struct State {
     std::atomic<bool> cancelled{false};
+    std::atomic<bool> told{false};
+    std::function<void(WorkQueue::Task)> onGlobal;
     WorkQueue::Task onExit;
     WorkQueue::Task onCancel;
     UniqueFd pidfd;
-    std::unique_ptr<DescriptorSource> source;  // queue only
+    std::unique_ptr<DescriptorSource> source;  // loop thread only
   };
   static void tell(const std::shared_ptr<State>& state) {
-    if (!state->cancelled.load()) state->onExit();
+    state->told.store(true);
+    state->onGlobal([state] {
+      if (!state->cancelled.load()) state->onExit();
+    });
+  }
+  void onLoop(WorkQueue::Task task) {
+    const auto loop = loop_.lock();
+    if (loop == nullptr) return;
+    if (loop->onLoopThread()) {
+      task();
+    } else {
+      loop->post(std::move(task));
+    }
   }
   void end(bool withHandler) noexcept {
     if (state_->cancelled.exchange(true)) return;
-    const auto queue = queue_.lock();
-    if (queue == nullptr) {
-      state_->source.reset();  // its thread has ended; the source's handler holds the state
-      return;
+    // An exit that was told is watched no more: the loop need not wake up for it.
+    if (!state_->told.load()) {
+      if (loop_.expired()) state_->source.reset();  // its handler holds the state
+      onLoop([state = state_] { state->source.reset(); });
     }
-    queue->post([state = state_, withHandler] {
-      state->source.reset();
-      if (withHandler && state->onCancel) state->onCancel();
-    });
+    if (withHandler && state_->onCancel) state_->onGlobal([state = state_] { state->onCancel(); });
   }
-  const std::weak_ptr<WorkQueue> queue_;
+  const std::weak_ptr<EventLoop> loop_;
   const std::shared_ptr<State> state_;
 };
 
 }  // namespace
 
 std::unique_ptr<SystemRunLoop> SystemRunLoop::make() {
-  auto loop = EventLoop::make();
+  auto loop = EventLoop::make(EventLoop::For::thisThread);
   if (loop == nullptr) return nullptr;
   return std::unique_ptr<SystemRunLoop>(new SystemRunLoop(std::move(loop)));
 }
@@ -239,22 +324,18 @@ std::unique_ptr<LoopSource> SystemRunLoop::addTimer(std::chrono::nanoseconds fir
 }
 
 SystemQueues::SystemQueues(SystemRunLoop& mainLoop)
-    : mainLoop_(mainLoop.eventLoop()), main_(std::make_unique<SystemQueue>(mainLoop_, "main")) {}
+    : mainLoop_(mainLoop.eventLoop()),
+      main_(std::make_unique<SystemQueue>(mainLoop_, "main")),
+      maker_(std::make_shared<Maker>()) {}
 
 SystemQueues::~SystemQueues() = default;
 
 WorkQueue& SystemQueues::main() noexcept { return *main_; }
 
-WorkQueue& SystemQueues::global() noexcept {
-  std::call_once(globalMade_, [this] { global_ = makeSerial("global", QualityOfService::standard); });
-  return *global_;
-}
+WorkQueue& SystemQueues::global() { return maker_->global(); }
 
 std::shared_ptr<WorkQueue> SystemQueues::makeSerial(std::string label, QualityOfService qualityOfService) {
-  auto loop = EventLoop::make();
-  // Out of descriptors: the work still has to happen somewhere, so it runs on the main queue.
-  if (loop == nullptr) return std::make_shared<SystemQueue>(mainLoop_, std::move(label));
-  return std::make_shared<ThreadQueue>(std::move(loop), std::move(label), qualityOfService);
+  return maker_->make(std::move(label), qualityOfService);
 }
 
 std::unique_ptr<ProcessExitSource> SystemQueues::makeProcessExitSource(pid_t pid, std::uint32_t startTime,
@@ -264,8 +345,19 @@ std::unique_ptr<ProcessExitSource> SystemQueues::makeProcessExitSource(pid_t pid
   if (!pidfd.isValid() && errno != ESRCH) return nullptr;
   // The id may have been given to another process since the caller learned it.
   if (pidfd.isValid() && processStartTime(pid) != startTime) pidfd.reset();
-  global();
-  return std::make_unique<PidfdExitSource>(global_, std::move(pidfd), std::move(onExit), std::move(onCancel));
+  const auto onGlobal = [weak = std::weak_ptr<Maker>(maker_),
+                         weakLoop = std::weak_ptr<EventLoop>(mainLoop_)](WorkQueue::Task task) {
+    const auto maker = weak.lock();
+    if (maker == nullptr) return;
+    try {
+      maker->global().post(task);
+    } catch (const OutOfQueues&) {
+      // These handlers are short: the main queue bears them.
+      if (const auto loop = weakLoop.lock()) loop->post(std::move(task));
+    }
+  };
+  return std::make_unique<PidfdExitSource>(mainLoop_, onGlobal, std::move(pidfd), std::move(onExit),
+                                           std::move(onCancel));
 }
 
 }  // namespace brenvik

@@ -4,7 +4,6 @@
 
 #include <atomic>
 #include <memory>
-#include <mutex>
 #include <string>
 
 #include "platform/runloop/RunLoop.h"
@@ -35,25 +34,30 @@ class SystemRunLoop final : public RunLoop {
 };
 
 // Queues on threads of their own, and the main queue on the main run loop. A process-exit source is a pidfd
-// (pidfd_open(2)) watched on the global queue.
+// (pidfd_open(2)) watched by the main run loop: the global queue's thread starts when there is something to
+// tell. Descriptors for kReservedQueues queues are kept back, so that clients who use up all others do not
+// keep the process's own work from starting.
 class SystemQueues final : public WorkQueues {
  public:
+  // As many as the helper ever has at a time.
+  static constexpr int kReservedQueues = 9;
+
   // The run loop must outlive this object.
   explicit SystemQueues(SystemRunLoop& mainLoop);
   ~SystemQueues() override;
 
   WorkQueue& main() noexcept override;
-  WorkQueue& global() noexcept override;
+  WorkQueue& global() override;
   std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override;
   std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t startTime,
                                                            WorkQueue::Task onExit,
                                                            WorkQueue::Task onCancel) override;
 
  private:
+  class Maker;
   const std::shared_ptr<EventLoop> mainLoop_;
   const std::unique_ptr<WorkQueue> main_;
-  std::once_flag globalMade_;
-  std::shared_ptr<WorkQueue> global_;
+  const std::shared_ptr<Maker> maker_;  // an exit that is told late finds it, or finds it gone
 };
 
 }  // namespace brenvik

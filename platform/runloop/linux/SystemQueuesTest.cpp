@@ -4,15 +4,21 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/filter.h>
+#include <linux/seccomp.h>
+#include <signal.h>
 #include <sys/epoll.h>
+#include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <array>
+#include <filesystem>
 #include <future>
 #include <limits>
+#include <vector>
 
 #include "platform/base/ProcessStartTime.h"
 
@@ -144,7 +150,7 @@ TEST_F(SystemQueuesTest, UtilityQueueIsNicerThanTheRest) {
     done.set_value({::getpriority(PRIO_PROCESS, self), ::syscall(SYS_ioprio_get, 1, 0)});
   });
   const auto [nice, ioPriority] = done.get_future().get();
-  EXPECT_EQ(nice, std::min(19, ::getpriority(PRIO_PROCESS, 0) + 10));
+  EXPECT_EQ(nice, 10);
   EXPECT_EQ(ioPriority, (2 << 13) | 7);
 }
 
@@ -200,6 +206,120 @@ TEST_F(SystemQueuesTest, QueueTimerRepeatsOnTheQueueUntilCancelled) {
   three.get_future().wait();
 }
 
+TEST_F(SystemQueuesTest, AQueueIsNotCurrentOnItsMakersThreadBeforeItsOwnHasStarted) {
+  SystemQueues queues(*loop);
+  const auto queue = queues.makeSerial("later", QualityOfService::standard);
+  EXPECT_FALSE(queue->isCurrent());
+  std::promise<std::thread::id> done;
+  queue->postAfter(0s, [&] { done.set_value(std::this_thread::get_id()); });
+  EXPECT_NE(done.get_future().get(), std::this_thread::get_id());
+}
+
+// Takes every descriptor that the process may have, until it is destroyed.
+class NoDescriptors {
+ public:
+  NoDescriptors() {
+    ::getrlimit(RLIMIT_NOFILE, &before_);
+    const rlimit few{256, before_.rlim_max};
+    ::setrlimit(RLIMIT_NOFILE, &few);
+    takeAll();
+  }
+  ~NoDescriptors() { ::setrlimit(RLIMIT_NOFILE, &before_); }
+  // Takes what has become free since; how many that were.
+  std::size_t takeAll() {
+    std::size_t count = 0;
+    for (;; ++count) {
+      UniqueFd fd(::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, 0));
+      if (!fd.isValid()) return count;
+      taken_.push_back(std::move(fd));
+    }
+  }
+
+ private:
+  rlimit before_{};
+  std::vector<UniqueFd> taken_;
+};
+
+// Runs a task on the queue and one that is delayed; whether both ran on a thread that is not this one.
+bool works(WorkQueue& queue) {
+  std::promise<bool> done;
+  queue.post([&] {
+    queue.postAfter(1ms, [&, on = std::this_thread::get_id()] {
+      done.set_value(on == std::this_thread::get_id() && queue.isCurrent());
+    });
+  });
+  return done.get_future().get() && !queue.isCurrent();
+}
+
+TEST_F(SystemQueuesTest, WithoutDescriptorsQueuesLiveOnTheReserveAndGetThreadsOfTheirOwn) {
+  SystemQueues queues(*loop);
+  NoDescriptors none;
+  std::vector<std::shared_ptr<WorkQueue>> made;
+  for (int i = 0; i < SystemQueues::kReservedQueues; ++i) {
+    made.push_back(queues.makeSerial("reserved", QualityOfService::standard));
+    EXPECT_EQ(none.takeAll(), 0U) << "no more is let go than a queue takes";
+    EXPECT_TRUE(works(*made.back()));
+  }
+}
+
+TEST_F(SystemQueuesTest, WithoutDescriptorsAndReserveMakingAQueueFailsAndIsNoOtherThreadsBurden) {
+  SystemQueues queues(*loop);
+  NoDescriptors none;
+  std::vector<std::shared_ptr<WorkQueue>> made;
+  for (int i = 0; i < SystemQueues::kReservedQueues; ++i) {
+    made.push_back(queues.makeSerial("reserved", QualityOfService::standard));
+  }
+  EXPECT_THROW((void)queues.makeSerial("one too many", QualityOfService::standard), OutOfQueues);
+  EXPECT_THROW((void)queues.global(), std::bad_alloc);
+  EXPECT_TRUE(works(*made.front()));
+}
+
+TEST_F(SystemQueuesTest, AQueueThatGoesGivesItsDescriptorsBackToTheReserve) {
+  SystemQueues queues(*loop);
+  NoDescriptors none;
+  std::vector<std::shared_ptr<WorkQueue>> made;
+  for (int i = 0; i < 3 * SystemQueues::kReservedQueues; ++i) {
+    if (made.size() == SystemQueues::kReservedQueues) made.clear();
+    EXPECT_EQ(none.takeAll(), 0U);
+    made.push_back(queues.makeSerial("again", QualityOfService::standard));
+  }
+}
+
+// From now on this process can start neither thread nor process.
+bool forbidThreads() {
+  constexpr auto refuse = static_cast<std::uint32_t>(SECCOMP_RET_ERRNO | EAGAIN);
+  std::array filter{
+      sock_filter BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
+      sock_filter BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_clone, 2, 0),
+      sock_filter BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_clone3, 1, 0),
+      sock_filter BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
+      sock_filter BPF_STMT(BPF_RET | BPF_K, refuse),
+  };
+  const sock_fprog program{filter.size(), filter.data()};
+  return ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 &&
+         ::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program) == 0;
+}
+
+TEST_F(SystemQueuesTest, WithoutThreadsTheFirstTaskIsRefused) {
+  const pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    SystemQueues queues(*loop);
+    const auto queue = queues.makeSerial("thread", QualityOfService::standard);
+    if (!forbidThreads()) ::_exit(2);
+    try {
+      queue->post([] {});
+      ::_exit(1);
+    } catch (const OutOfQueues&) {
+      ::_exit(0);
+    }
+  }
+  int status = -1;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+}
+
 class ProcessExitTest : public SystemQueuesTest {
  protected:
   // A child that lives until the returned descriptor is closed.
@@ -227,8 +347,53 @@ TEST_F(ProcessExitTest, TellsOnceThatTheProcessHasExited) {
   ASSERT_NE(source, nullptr);
   source->activate();
   life.reset();
+  ASSERT_EQ(loop->run(20s, ReturnAfterSource::yes), RunResult::handledSource);
   EXPECT_TRUE(told.get_future().get());
   ::waitpid(pid, nullptr, 0);
+}
+
+TEST_F(ProcessExitTest, NoThreadIsStartedWhileThereIsNothingToTell) {
+  SystemQueues queues(*loop);
+  auto [pid, life] = child();
+  const auto source =
+      queues.makeProcessExitSource(pid, processStartTime(pid).value(), [] { ADD_FAILURE() << "told"; }, {});
+  ASSERT_NE(source, nullptr);
+  source->activate();
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::no), RunResult::timedOut);
+  const auto threads = std::filesystem::directory_iterator("/proc/self/task");
+  EXPECT_EQ(std::distance(begin(threads), end(threads)), 1);
+  source->cancel();
+  life.reset();
+  ::waitpid(pid, nullptr, 0);
+}
+
+TEST_F(ProcessExitTest, MayBeMadeOnAnyThreadAndOutliveTheQueues) {
+  auto queues = std::make_unique<SystemQueues>(*loop);
+  auto [pid, life] = child();
+  std::promise<void> told;
+  std::unique_ptr<ProcessExitSource> source;
+  std::thread other([&, child = pid] {
+    source =
+        queues->makeProcessExitSource(child, processStartTime(child).value(), [&] { told.set_value(); }, {});
+    source->activate();
+  });
+  other.join();
+  auto [latePid, lateLife] = child();
+  const auto late =
+      queues->makeProcessExitSource(latePid, processStartTime(latePid).value(),
+                                    [] { ADD_FAILURE() << "told after the queues had gone"; }, {});
+  late->activate();
+  ASSERT_EQ(::kill(pid, SIGKILL), 0);  // the second child holds the first one's pipe, too
+  const auto future = told.get_future();
+  for (int i = 0; i < 2000 && future.wait_for(1ms) != std::future_status::ready; ++i) {
+    (void)loop->run(10ms, ReturnAfterSource::no);
+  }
+  ASSERT_EQ(future.wait_for(0s), std::future_status::ready);
+  queues.reset();
+  ASSERT_EQ(::kill(latePid, SIGKILL), 0);
+  EXPECT_EQ(loop->run(20s, ReturnAfterSource::yes), RunResult::handledSource);
+  ::waitpid(pid, nullptr, 0);
+  ::waitpid(latePid, nullptr, 0);
 }
 
 TEST_F(ProcessExitTest, TellsAtOnceWhenTheProcessIsGoneOrTheIdNamesAnother) {
@@ -237,7 +402,7 @@ TEST_F(ProcessExitTest, TellsAtOnceWhenTheProcessIsGoneOrTheIdNamesAnother) {
   const std::uint32_t startTime = processStartTime(pid).value();
   std::promise<void> another;
   const auto wrong = queues.makeProcessExitSource(pid, startTime + 1, [&] { another.set_value(); }, {});
-  wrong->activate();
+  wrong->activate();  // on the loop's own thread: nothing has to be waited for
   another.get_future().wait();
   life.reset();
   ::waitpid(pid, nullptr, 0);
