@@ -8,7 +8,8 @@
 
 namespace brenvik {
 
-int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests) {
+int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests,
+              const std::function<void()>& endWork) {
   std::shared_ptr<HostedBasebandServer> hosted;
   if (baseband.canHost()) {
     hosted = baseband.create(nullptr);
@@ -19,6 +20,7 @@ int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const R
   if (ServerContext* const server = CreateServer(platform, kServiceName, requests); server != nullptr) {
     if (hosted != nullptr) SetIdleCheck(server, [hosted] { return hosted->isBusy(); });
     RunServer(*server);
+    endWork();
     DestroyServer(server);
     status = 0;
   }

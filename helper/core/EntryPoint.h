@@ -2,6 +2,8 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <functional>
+
 #include "Helper/Shared/Server/HelperServerUtils.h"
 #include "platform/baseband/HostedBasebandServer.h"
 
@@ -10,6 +12,10 @@ namespace brenvik {
 // The life of the process from the first service to the exit status: hosts the baseband server where there is
 // one, checks the service name in, serves until the idle rule ends it, and stops the hosted server. 0, or 1
 // when the service could not be set up (which is logged). Main thread.
-int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests);
+//
+// `endWork` runs when serving is over and the server still stands: it ends the work of other threads, which
+// gives its busy tokens back to that server.
+int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests,
+              const std::function<void()>& endWork);
 
 }  // namespace brenvik

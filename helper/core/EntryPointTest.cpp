@@ -44,17 +44,40 @@ class EntryPointTest : public testing::Test {
       ports, bootstrap, sources, loop, [](const char*, const AuditToken&) { return true; }, registry};
   NoRoutines requests;
   FakeBasebandLibrary baseband;
+  int worksEnded = 0;
+  std::function<void()> endWork = [this] { ++worksEnded; };
   RecordingLog log;
 };
 
 TEST_F(EntryPointTest, ServesUntilTheIdleRuleEndsItAndExitsWith0) {
   baseband.hosts = false;
   letTheIdleRuleEndIt();
-  EXPECT_EQ(runHelper(baseband, platform, requests), 0);
+  EXPECT_EQ(runHelper(baseband, platform, requests, endWork), 0);
   EXPECT_EQ(bootstrap.name, "com.norvale.brenvik.mobile-helper");
   EXPECT_EQ(baseband.record, "canHost run ");
+  EXPECT_EQ(worksEnded, 1);
   EXPECT_EQ(registry.size(), 0U);
   EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(EntryPointTest, WorkOfOtherThreadsEndsWhileTheServerItHoldsATokenOfStillStands) {
+  baseband.hosts = false;
+  std::uint32_t token = 0;
+  ServerContext* server = nullptr;
+  loop.whenRun = [&] {
+    server = LookupServer(registry, sources.routineSources.at(0)->port);
+    ASSERT_NE(server, nullptr);
+    token = AcquireBusyToken(*server);
+    StopServer(*server);
+  };
+  endWork = [&] {
+    EXPECT_EQ(LookupServer(registry, sources.routineSources.at(0)->port), server);
+    EXPECT_EQ(ReleaseBusyToken(*server, token), 1U);
+  };
+  EXPECT_EQ(runHelper(baseband, platform, requests, endWork), 0);
+  EXPECT_EQ(token, 1U);
+  EXPECT_EQ(registry.size(), 0U);
+  EXPECT_EQ(loop.timers(), 0U) << "the countdown that the token's return began went with the server";
 }
 
 TEST_F(EntryPointTest, AHostedServerIsStartedBeforeAndStoppedAfterTheServiceAndAskedAtEachTick) {
@@ -69,7 +92,7 @@ TEST_F(EntryPointTest, AHostedServerIsStartedBeforeAndStoppedAfterTheServiceAndA
       tick();
     };
   };
-  EXPECT_EQ(runHelper(baseband, platform, requests), 0);
+  EXPECT_EQ(runHelper(baseband, platform, requests, endWork), 0);
   EXPECT_EQ(baseband.busyQuestions, 3);
   EXPECT_EQ(baseband.record, "canHost create start run stop release ");
 }
@@ -77,13 +100,13 @@ TEST_F(EntryPointTest, AHostedServerIsStartedBeforeAndStoppedAfterTheServiceAndA
 TEST_F(EntryPointTest, ALibraryThatMakesNoServerHostsNone) {
   baseband.makesServer = false;
   letTheIdleRuleEndIt();
-  EXPECT_EQ(runHelper(baseband, platform, requests), 0);
+  EXPECT_EQ(runHelper(baseband, platform, requests, endWork), 0);
   EXPECT_EQ(baseband.record, "canHost create run ");
 }
 
 TEST_F(EntryPointTest, AServiceThatCannotBeSetUpIsLoggedTwiceAndExitsWith1AfterStoppingTheHostedServer) {
   bootstrap.refuseWith = kern::noAccess;
-  EXPECT_EQ(runHelper(baseband, platform, requests), 1);
+  EXPECT_EQ(runHelper(baseband, platform, requests, endWork), 1);
   EXPECT_EQ(
       log.entries(),
       (std::vector{
@@ -91,6 +114,7 @@ TEST_F(EntryPointTest, AServiceThatCannotBeSetUpIsLoggedTwiceAndExitsWith1AfterS
           RecordingLog::unifiedLine(LogLevel::error, "unable to startup BrenvikMobileHelper server")}));
   EXPECT_EQ(baseband.record, "canHost create start stop release ");
   EXPECT_EQ(loop.runs, 0);
+  EXPECT_EQ(worksEnded, 0);
 }
 
 }  // namespace

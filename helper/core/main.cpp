@@ -53,8 +53,10 @@ void prepareProcess() noexcept {
     descriptors.rlim_cur = std::min(kDescriptors, descriptors.rlim_max);
     (void)::setrlimit(RLIMIT_NOFILE, &descriptors);
   }
-  // A reader of standard error that went away must not end the process.
+  // A reader of standard error that went away must not end the process, nor a file that reaches the size
+  // limit: both are errors of the call that met them.
   (void)std::signal(SIGPIPE, SIG_IGN);
+  (void)std::signal(SIGXFSZ, SIG_IGN);
   (void)::umask(022);
 }
 
@@ -143,11 +145,13 @@ int run() {
                                 [&entitlements](const char* entitlement, const AuditToken& caller) {
                                   return entitlements.HasEntitlement(entitlement, caller);
                                 }};
-  const int status = runHelper(baseband, platform, requests);
-  // The first lets a transfer under way end, for which a check would wait.
-  web.shutDown();
-  lasd->shutDown();
-  heartbeat.shutDown();
+  const auto endWork = [&] {
+    // The first lets a transfer under way end, for which a check would wait.
+    web.shutDown();
+    lasd->shutDown();
+    heartbeat.shutDown();
+  };
+  const int status = runHelper(baseband, platform, requests, endWork);
   setLogSink(nullptr);
   return status;
 }

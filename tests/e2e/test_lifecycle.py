@@ -3,6 +3,8 @@
 """Start, refusal, idle exit: the life of the real process."""
 import os
 import pathlib
+import plistlib
+import resource
 import socket
 import subprocess
 import sys
@@ -86,6 +88,17 @@ class StandingAlone(HelperTest):
             self.assertEqual(as_account("stranger", refused_with), 35)
         self.assertEqual(self.daemon.wait(), 0)
         self.assertLess(time.monotonic() - closed, IDLE + 3)
+
+
+    def test_a_file_that_reaches_the_size_limit_is_an_error_of_its_writer_and_not_the_end(self):
+        client = self.client()
+        self.assertEqual(client.set_preference("com.example.limit", "key", plistlib.dumps("small")), 0)
+        resource.prlimit(self.daemon.pid, resource.RLIMIT_FSIZE, (4096, 4096))
+        client.set_preference("com.example.limit", "key", plistlib.dumps("x" * 20000))
+        eventually(lambda: any(level == ERROR and "com.example.limit" in text for _, level, text in self.logs.lines),
+                   what="an error line that names the domain")
+        self.assertTrue(self.daemon.running())
+        self.assertEqual(plistlib.loads(client.copy_preference("com.example.limit", "key")), "small")
 
 
 def refused_with():
