@@ -48,6 +48,16 @@ class FarEnd:
         for address in [theirs] if isinstance(theirs, str) else theirs:
             self.ip("address", "add", address, "dev", self.far, *(["nodad"] if ":" in address else []))
         self.ip("link", "set", self.far, "up")
+        self._wait_until_up()
+
+    def _wait_until_up(self):
+        """The kernel notices a little later that both ends are up, and drops what is sent before that."""
+        end = time.monotonic() + 10
+        for command in (["ip", "link", "show", "dev", self.name], self.command("ip", "link", "show", "dev", self.far)):
+            while "state UP" not in run(*command).stdout:
+                if time.monotonic() > end:
+                    raise AssertionError(f"{self.name} does not come up")
+                time.sleep(0.01)
 
     def _wait_for_own_namespace(self):
         end = time.monotonic() + 10

@@ -86,6 +86,14 @@ class PrivateNetwork {
     return ok;
   }
 
+  // Waits until the interface carries packets; false when it does not within a few seconds. The kernel
+  // notices that the other end of a pair is up a little later, and drops what is sent before that.
+  bool waitUntilUp(const std::string& interfaceName) {
+    return ip("link show dev " + interfaceName + " > /dev/null && for i in $(seq 500); do " +
+              "ip link show dev " + interfaceName +
+              " | grep -q 'state UP' && exit 0; sleep 0.01; done; exit 1");
+  }
+
   // Writes one of the namespace's settings, such as "net/ipv4/ping_group_range".
   bool set(const std::string& setting, const std::string& value) {
     bool ok = false;

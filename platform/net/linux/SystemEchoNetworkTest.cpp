@@ -42,6 +42,7 @@ class SystemEchoNetworkTest : public testing::Test {
     ASSERT_TRUE(ours.ip("link set pdp_ip0 up"));
     ASSERT_TRUE(theirs.ip("address add 10.9.0.2/24 dev far0"));
     ASSERT_TRUE(theirs.ip("link set far0 up"));
+    ASSERT_TRUE(ours.waitUntilUp("pdp_ip0") && theirs.waitUntilUp("far0"));
   }
   void openDatagramSockets(bool open) {
     ASSERT_TRUE(ours.set("net/ipv4/ping_group_range", open ? "0 2147483647" : "1 0"));

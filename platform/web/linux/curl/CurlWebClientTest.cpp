@@ -524,6 +524,7 @@ class CurlWebClientNetworkTest : public CurlWebClientTest {
     ASSERT_TRUE(ours.ip("link set " + name + " up"));
     ASSERT_TRUE(theirs.ip("address add 10.7." + n + ".2/24 dev far" + n));
     ASSERT_TRUE(theirs.ip("link set far" + n + " up"));
+    ASSERT_TRUE(ours.waitUntilUp(name) && theirs.waitUntilUp("far" + n));
     theirs.run([&] { taps.push_back(std::make_unique<PacketTap>(("far" + n).c_str())); });
     ASSERT_TRUE(taps.back()->isMade());
   }
