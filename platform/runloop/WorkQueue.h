@@ -43,7 +43,8 @@ class WorkQueue {
   class Timer {
    public:
     virtual ~Timer() = default;  // cancels
-    virtual void activate() = 0;
+    // False when the system cannot time it, so that it will never fire; off the queue that is not known yet.
+    virtual bool activate() = 0;
     virtual void cancel() noexcept = 0;
   };
   virtual std::unique_ptr<Timer> makeTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,

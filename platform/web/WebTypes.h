@@ -27,10 +27,11 @@ enum class WebRequestType : std::int32_t { get = 0 };
 enum class WebErrorKind : std::int32_t {
   unknown = 0,
   none = 1,
-  clientUnavailable = 2,   // the HTTP client could not be loaded or started
-  cancelled = 3,           // the client was destroyed first
-  hostNotFound = 4,        // the name was looked up and has no address, or no name server answered
-  cannotConnect = 5,       // refused, unreachable
+  clientUnavailable =
+      2,              // the HTTP client could not be loaded or started, or has no descriptors to work with
+  cancelled = 3,      // the client was destroyed first
+  hostNotFound = 4,   // the name was looked up and has no address, or no name server answered
+  cannotConnect = 5,  // refused, unreachable
   cellularNotAllowed = 6,  // the way there is cellular only, and the session does not allow it
   timedOut = 7,            // connecting, stalling or the request's own limit
   connectionLost = 8,      // ended or reset before the response was whole

@@ -118,10 +118,12 @@ class ManualWorkQueue::ManualTimer final : public WorkQueue::Timer {
         interval_(interval),
         handler_(std::make_shared<Task>(std::move(handler))) {}
   ~ManualTimer() override { cancel(); }
-  void activate() override {
-    if (active_) return;
-    active_ = true;
-    arm(first_);
+  bool activate() override {
+    if (!active_) {
+      active_ = true;
+      arm(first_);
+    }
+    return true;
   }
   void cancel() noexcept override {
     if (!active_) return;

@@ -47,10 +47,10 @@ class QueueTimer final : public WorkQueue::Timer {
         interval_(interval),
         leeway_(leeway),
         handler_(std::move(handler)) {}
-  void activate() override {
+  bool activate() override {
     const std::lock_guard hold(lock_);
-    if (source_ != nullptr) return;
-    source_ = loop_->addTimer(first_, interval_, leeway_, handler_, {});
+    if (source_ == nullptr) source_ = loop_->addTimer(first_, interval_, leeway_, handler_, {});
+    return source_ != nullptr;
   }
   void cancel() noexcept override {
     const std::lock_guard hold(lock_);

@@ -151,8 +151,9 @@ struct CurlWebClient::Transfer {
   bool wayWasCellular = false;
   std::optional<WebErrorKind> ownVerdict;  // why one of our callbacks stopped it
 
-  // Tells the outcome, which may be done once.
+  // Tells the outcome, the first time only.
   void finish(WebErrorKind kind) {
+    if (response == nullptr) return;
     response->errorKind = kind;
     if (kind != WebErrorKind::none) response->body = {};
     if (callbackQueue == nullptr || !completion) return;
@@ -264,12 +265,12 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
     }
     if (queue == nullptr) return;
     if (queue->isCurrent()) {
-      abandonAll();
+      abandonAll(WebErrorKind::cancelled);
       return;
     }
     std::promise<void> abandoned;
     queue->post([this, &abandoned] {
-      abandonAll();
+      abandonAll(WebErrorKind::cancelled);
       abandoned.set_value();
     });
     abandoned.get_future().wait();
@@ -280,6 +281,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
 
   void start(const std::shared_ptr<Transfer>& transfer) {
     try {
+      if (givingUp_) abandonAll(WebErrorKind::clientUnavailable);
       if (multi_ == nullptr && !makeMulti()) return transfer->finish(WebErrorKind::outOfMemory);
       attempt(transfer);
     } catch (...) {
@@ -395,18 +397,21 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
       const std::uint32_t events = ((what & CURL_POLL_IN) != 0 ? std::uint32_t{EPOLLIN} : 0U) |
                                    ((what & CURL_POLL_OUT) != 0 ? std::uint32_t{EPOLLOUT} : 0U);
       auto& source = driver.sockets_[fd];
-      if (source != nullptr) return source->setEvents(events) ? 0 : -1;
-      source = driver.loop_->watchDescriptor(fd, events, [&driver, fd](std::uint32_t ready) {
-        int mask = 0;
-        if ((ready & (EPOLLIN | EPOLLHUP)) != 0) mask |= CURL_CSELECT_IN;
-        if ((ready & EPOLLOUT) != 0) mask |= CURL_CSELECT_OUT;
-        if ((ready & EPOLLERR) != 0) mask |= CURL_CSELECT_ERR;
-        driver.act(fd, mask);
-      });
-      return source != nullptr ? 0 : -1;
-    } catch (...) {
-      return -1;  // libcurl then fails its transfers
+      if (source != nullptr && source->setEvents(events)) return 0;
+      if (source == nullptr) {
+        source = driver.loop_->watchDescriptor(fd, events, [&driver, fd](std::uint32_t ready) {
+          int mask = 0;
+          if ((ready & (EPOLLIN | EPOLLHUP)) != 0) mask |= CURL_CSELECT_IN;
+          if ((ready & EPOLLOUT) != 0) mask |= CURL_CSELECT_OUT;
+          if ((ready & EPOLLERR) != 0) mask |= CURL_CSELECT_ERR;
+          driver.act(fd, mask);
+        });
+        if (source != nullptr) return 0;
+      }
+    } catch (...) {  // as below
     }
+    driver.giveUpSoon();
+    return -1;
   }
 
   static int onTimer(CURLM*, long delay, void* self) noexcept {
@@ -426,11 +431,25 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
   }
 
   void arm() noexcept {
-    armedFor_ = *due_;
-    const auto delay = std::max(Clock::duration::zero(), armedFor_ - Clock::now());
-    timer_ =
-        loop_->makeTimer(delay, std::chrono::nanoseconds::zero(), kTimerLeeway, [this] { timerFired(); });
-    if (timer_ != nullptr) timer_->activate();
+    try {
+      armedFor_ = *due_;
+      const auto delay = std::max(Clock::duration::zero(), armedFor_ - Clock::now());
+      timer_ =
+          loop_->makeTimer(delay, std::chrono::nanoseconds::zero(), kTimerLeeway, [this] { timerFired(); });
+      if (timer_ != nullptr && timer_->activate()) return;
+    } catch (...) {  // as below
+    }
+    timer_.reset();
+    giveUpSoon();
+  }
+
+  // The loop cannot watch a socket or time a wait, for want of descriptors or memory. libcurl does not end
+  // what it waits for in vain, so that is done here, once its callback has returned.
+  void giveUpSoon() noexcept {
+    if (std::exchange(givingUp_, true)) return;
+    loop_->post([weak = weak_from_this()] {
+      if (const auto self = weak.lock(); self != nullptr) self->abandonAll(WebErrorKind::clientUnavailable);
+    });
   }
 
   void timerFired() {
@@ -445,6 +464,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
   }
 
   void act(curl_socket_t fd, int mask) {
+    if (givingUp_) return;  // libcurl 7.88 crashes when it is called after a callback of ours refused
     int running = 0;
     (void)curl_multi_socket_action(multi_.get(), fd, mask, &running);  // what failed shows in the messages
     int left = 0;
@@ -527,22 +547,26 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
         return WebErrorKind::malformedResponse;
       case CURLE_OUT_OF_MEMORY:
         return WebErrorKind::outOfMemory;
+      case CURLE_ABORTED_BY_CALLBACK:
+        return WebErrorKind::clientUnavailable;  // see giveUpSoon()
       default:
         return WebErrorKind::unknown;
     }
   }
 
-  void abandonAll() {
+  void abandonAll(WebErrorKind kind) {
+    givingUp_ = true;  // what the loop still refuses below does not matter any more
     const auto abandoned = std::exchange(active_, {});
     for (const auto& [easy, transfer] : abandoned) {
       (void)curl_multi_remove_handle(multi_.get(), easy);
       transfer->easy.reset();
-      transfer->finish(WebErrorKind::cancelled);
+      transfer->finish(kind);
     }
     multi_.reset();  // while its sockets can still be taken out of the loop
     sockets_.clear();
     timer_.reset();
     due_.reset();
+    givingUp_ = false;
   }
 
   const CurlSettings settings_;
@@ -555,6 +579,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
   std::unique_ptr<WorkQueue::Timer> timer_;
   Clock::time_point armedFor_;
   std::optional<Clock::time_point> due_;
+  bool givingUp_ = false;
   Multi multi_;
   std::map<CURL*, std::shared_ptr<Transfer>> active_;
 };

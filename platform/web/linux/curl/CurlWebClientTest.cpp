@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 #include <zlib.h>
 
+#include <atomic>
 #include <csignal>
 #include <filesystem>
 #include <fstream>
@@ -40,6 +41,60 @@ std::string gzip(const std::string& text) {
 std::string textOf(const WebResponse& response) {
   return {reinterpret_cast<const char*>(response.body.data()), response.body.size()};
 }
+
+// A queue of a system that runs short: it works, and refuses to watch sockets or to time as it is told.
+class ShortQueue final : public WorkQueue {
+ public:
+  struct Refusals {
+    std::atomic<bool> descriptors{false};
+    std::atomic<bool> timers{false};
+  };
+  ShortQueue(std::shared_ptr<WorkQueue> real, Refusals& refusals)
+      : real_(std::move(real)), refusals_(refusals) {}
+  const std::string& label() const noexcept override { return real_->label(); }
+  void post(Task task) override { real_->post(std::move(task)); }
+  void postAfter(std::chrono::nanoseconds delay, Task task) override {
+    real_->postAfter(delay, std::move(task));
+  }
+  std::unique_ptr<Timer> makeTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
+                                   std::chrono::nanoseconds leeway, Task handler) override {
+    if (refusals_.timers) return std::make_unique<DeadTimer>();
+    return real_->makeTimer(first, interval, leeway, std::move(handler));
+  }
+  bool isCurrent() const noexcept override { return real_->isCurrent(); }
+  std::unique_ptr<DescriptorSource> watchDescriptor(int fd, std::uint32_t events,
+                                                    RunLoop::DescriptorHandler handler) override {
+    return refusals_.descriptors ? nullptr : real_->watchDescriptor(fd, events, std::move(handler));
+  }
+
+ private:
+  class DeadTimer final : public Timer {
+   public:
+    bool activate() override { return false; }
+    void cancel() noexcept override {}
+  };
+  const std::shared_ptr<WorkQueue> real_;
+  Refusals& refusals_;
+};
+
+class ShortQueues final : public WorkQueues {
+ public:
+  explicit ShortQueues(WorkQueues& real) : real_(real) {}
+  WorkQueue& main() noexcept override { return real_.main(); }
+  WorkQueue& global() noexcept override { return real_.global(); }
+  std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
+    return std::make_shared<ShortQueue>(real_.makeSerial(std::move(label), qualityOfService), refusals);
+  }
+  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t startTime,
+                                                           WorkQueue::Task onExit,
+                                                           WorkQueue::Task onCancel) override {
+    return real_.makeProcessExitSource(pid, startTime, std::move(onExit), std::move(onCancel));
+  }
+  ShortQueue::Refusals refusals;
+
+ private:
+  WorkQueues& real_;
+};
 
 class CurlWebClientTest : public testing::Test {
  protected:
@@ -491,6 +546,25 @@ TEST_F(CurlWebClientTest, WhatIsUnderWayWhenTheClientIsDestroyedCompletesAsCance
   expectKind(WebErrorKind::cancelled, answer.get());
   late->send({});
   expectKind(WebErrorKind::cancelled, lateAnswer.get_future().get());
+}
+
+TEST_F(CurlWebClientTest, WithoutDescriptorsOrTimersToWorkWithRequestsCompleteAndLaterOnesWork) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.respond("200 OK", "x");
+  });
+  ShortQueues shortQueues(queues);
+  client = CurlWebClient::make(shortQueues, settings);
+  for (std::atomic<bool>* refused : {&shortQueues.refusals.descriptors, &shortQueues.refusals.timers}) {
+    *refused = true;
+    auto first = start(server.url(), {});
+    auto second = start(server.url("/second", "127.0.0.1"), {});
+    expectKind(WebErrorKind::clientUnavailable, first.get());
+    expectKind(WebErrorKind::clientUnavailable, second.get());
+    *refused = false;
+    EXPECT_EQ(textOf(*fetch(server.url())), "x");
+  }
+  client.reset();
 }
 
 TEST_F(CurlWebClientTest, ARequestNobodyWaitsForIsHarmless) {
