@@ -134,6 +134,8 @@ bool EventLoop::onLoopThread() const noexcept {
   return thread_.load(std::memory_order_relaxed) == std::this_thread::get_id();
 }
 
+void EventLoop::leaveToAnotherThread() noexcept { thread_.store({}, std::memory_order_relaxed); }
+
 int EventLoop::runOnce(std::uint64_t timeOut) noexcept {
   thread_.store(std::this_thread::get_id(), std::memory_order_relaxed);
   return sd_event_run(event_.get(), timeOut);

@@ -106,7 +106,9 @@ class ThreadQueue final : public SystemQueue {
   ThreadQueue(std::shared_ptr<EventLoop> loop, std::string label, QualityOfService qualityOfService)
       : SystemQueue(std::move(loop), std::move(label)),
         qualityOfService_(qualityOfService),
-        quit_(std::make_shared<std::atomic<bool>>(false)) {}
+        quit_(std::make_shared<std::atomic<bool>>(false)) {
+    loop_->leaveToAnotherThread();
+  }
 
   ~ThreadQueue() override {
     quit_->store(true);

@@ -125,6 +125,18 @@ TEST_F(SystemQueuesTest, MainQueueRunsTasksInOrderOnTheLoop) {
   EXPECT_TRUE(queues.main().isCurrent());
 }
 
+TEST_F(SystemQueuesTest, ASerialQueueIsNotItsMakersEvenBeforeItsThreadRuns) {
+  SystemQueues queues(*loop);
+  for (int i = 0; i < 20; ++i) {
+    const auto queue = queues.makeSerial("new", QualityOfService::standard);
+    EXPECT_FALSE(queue->isCurrent());
+    std::promise<std::thread::id> ranOn;
+    queue->postAfter(0s, [&] { ranOn.set_value(std::this_thread::get_id()); });  // starts the thread, too
+    EXPECT_FALSE(queue->isCurrent());
+    EXPECT_NE(ranOn.get_future().get(), std::this_thread::get_id());
+  }
+}
+
 TEST_F(SystemQueuesTest, SerialQueueRunsItsTasksInOrderOnOneThreadOfItsOwn) {
   SystemQueues queues(*loop);
   const auto queue = queues.makeSerial("a label longer than sixteen characters", QualityOfService::standard);
