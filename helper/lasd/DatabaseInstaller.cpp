@@ -19,9 +19,13 @@ namespace {
 
 constexpr mode_t kDirectoryMode = 0755;
 
+UniqueFd openDirectory(const std::string& path, int flags = 0) {
+  return UniqueFd(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC | flags));
+}
+
 // So that a power cut cannot undo the rename after the record of it was stored.
 void syncDirectory(const std::string& path) {
-  const UniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const UniqueFd directory = openDirectory(path);
   if (directory.isValid())
     (void)::fsync(directory.get());  // not every file system can, and the name is there
 }
@@ -45,7 +49,10 @@ bool DatabaseInstaller::makeDirectory() {
     logUnified(LogLevel::error, "Cannot create %s errno set to %s", path, std::strerror(errno));
     return false;
   }
-  (void)::chmod(path, kDirectoryMode);  // whatever the umask took away; without it the folder still serves us
+  // Whatever the umask took away; without it the folder still serves us. Not by its name: the folder above is
+  // another account's, which could put a link to anything there.
+  if (const UniqueFd made = openDirectory(parts_.directory, O_NOFOLLOW); made.isValid())
+    (void)::fchmod(made.get(), kDirectoryMode);
   return true;
 }
 

@@ -64,6 +64,14 @@ TEST_F(DatabaseInstallerTest, AMissingDirectoryIsMadeWithMode0755AndTheDatabaseP
                info("Downloaded gsm database version 2.1 successfully")});
 }
 
+TEST_F(DatabaseInstallerTest, WithoutAPreviousFileNothingIsRemovedAndTheRenameStillHappens) {
+  std::filesystem::create_directory(directory);
+  serveGzip(kUrl, "database");
+  EXPECT_TRUE(install());
+  EXPECT_EQ(contentOf(at("gsm.db")), "database");
+  for (const auto& line : log.entries()) EXPECT_FALSE(line.line.starts_with("Removed old database"));
+}
+
 TEST_F(DatabaseInstallerTest, AnOlderDatabaseIsRemovedBeforeTheNewOneIsMovedIn) {
   std::filesystem::create_directory(directory);
   std::ofstream(at("gsm.db")) << "older";

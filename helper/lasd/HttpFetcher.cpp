@@ -11,6 +11,7 @@
 #include <condition_variable>
 #include <cstdio>
 #include <cstring>
+#include <exception>
 #include <mutex>
 #include <utility>
 
@@ -81,7 +82,7 @@ std::uint64_t roomFor(int file, std::uint64_t reserve) {
 HttpFetcher::HttpFetcher(const Parts& parts)
     : parts_(parts), queue_(parts.queues.makeSerial(kQueueLabel, QualityOfService::utility)) {}
 
-bool HttpFetcher::fetch(const std::string& url, WifiOnly wifiOnly) {
+bool HttpFetcher::fetch(const std::string& url, WifiOnly wifiOnly) noexcept try {
   body_.clear();
   headers_.clear();
   if (url.empty()) {
@@ -92,7 +93,9 @@ bool HttpFetcher::fetch(const std::string& url, WifiOnly wifiOnly) {
   const HeaderMap requestHeaders{{"Accept-Encoding", "gzip"}};
   const auto session = parts_.web.makeSession();
   if (wifiOnly == WifiOnly::yes) session->setCellularAllowed(false);
-  const auto request = parts_.web.makeRequest(WebRequestType::get, url, requestHeaders, session);
+  auto request = parts_.web.makeRequest(WebRequestType::get, url, requestHeaders, session);
+  // A completion that is waited for on its own queue would never come.
+  if (queue_->isCurrent()) request.reset();
   if (request == nullptr) {
     logUnified(LogLevel::error, "Cannot create HTTP request for URL %s", url.c_str());
     return false;
@@ -106,6 +109,9 @@ bool HttpFetcher::fetch(const std::string& url, WifiOnly wifiOnly) {
   request->send({});
   semaphore->wait();
   return !body_.empty();
+} catch (const std::exception&) {  // no memory or no thread, and nothing was sent
+  logUnified(LogLevel::error, "Cannot create HTTP request for URL %s", url.c_str());
+  return false;
 }
 
 void HttpFetcher::completed(const std::string& url, const std::shared_ptr<WebResponse>& response) {

@@ -20,7 +20,7 @@ inline constexpr std::uint64_t kDiskReserve = std::uint64_t{16} << 20;
 enum class WifiOnly : bool { no, yes };
 
 // Downloads one URL into memory and can then write what came, gunzipped, to a file. Made for one fetch, on
-// the caller's stack. One thread at a time, and not the one that runs this object's own queue.
+// the caller's stack. One thread at a time.
 class HttpFetcher {
  public:
   // What it works with; all of it outlives the fetcher.
@@ -36,8 +36,8 @@ class HttpFetcher {
   HttpFetcher& operator=(const HttpFetcher&) = delete;
 
   // Blocks until the HTTP client reports, without a limit of its own. True when a body came that is not
-  // empty.
-  bool fetch(const std::string& url, WifiOnly wifiOnly);
+  // empty. Fails at once on this object's own queue, which it would block.
+  bool fetch(const std::string& url, WifiOnly wifiOnly) noexcept;
 
   // Writes the body, which must have been delivered as a gzip file, uncompressed to the path. The file is on
   // the disk when this returns true; when it returns false, there is none.

@@ -5,6 +5,8 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <atomic>
+#include <future>
 #include <thread>
 
 #include "helper/lasd/LasdTestSupport.h"
@@ -148,6 +150,43 @@ TEST_F(HttpFetcherTest, FetchBlocksUntilTheClientReports) {
   web.releaseAnswers();
   waiting.join();
   EXPECT_EQ(textOf(fetcher), "late");
+}
+
+TEST_F(HttpFetcherTest, OnItsOwnQueueAFetchFailsAtOnce) {
+  // As where no queue can be had but the main one: the completion would wait for the fetch, and it for that.
+  class OneQueue final : public WorkQueues {
+   public:
+    explicit OneQueue(WorkQueues& real) : real_(real), queue(real.makeSerial("one", {})) {}
+    WorkQueue& main() noexcept override { return real_.main(); }
+    WorkQueue& global() noexcept override { return real_.global(); }
+    std::shared_ptr<WorkQueue> makeSerial(std::string, QualityOfService) override { return queue; }
+    std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t, std::uint32_t, WorkQueue::Task,
+                                                             WorkQueue::Task) override {
+      return nullptr;
+    }
+
+   private:
+    WorkQueues& real_;
+
+   public:
+    const std::shared_ptr<WorkQueue> queue;
+  } one(queues);
+  web.answer(kUrl, 200, "body");
+  std::promise<bool> result;
+  one.queue->post([&] {
+    HttpFetcher fetcher({one, web, gunzip, 0});
+    result.set_value(fetcher.fetch(kUrl, WifiOnly::yes));
+  });
+  EXPECT_FALSE(result.get_future().get());
+  EXPECT_EQ(log.entries().back(), error(std::string("Cannot create HTTP request for URL ") + kUrl));
+  EXPECT_TRUE(web.seen().empty());
+}
+
+TEST_F(HttpFetcherTest, WithoutMemoryForARequestAFetchFails) {
+  web.exhausted = true;
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_FALSE(fetcher.fetch(kUrl, WifiOnly::yes));
+  EXPECT_EQ(log.entries().back(), error(std::string("Cannot create HTTP request for URL ") + kUrl));
 }
 
 TEST_F(HttpFetcherTest, ASecondFetchClearsWhatTheFirstBrought) {

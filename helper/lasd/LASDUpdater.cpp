@@ -31,6 +31,20 @@ PropertyList onlyString(PropertyList value) {
 
 std::string_view textOf(const PropertyList& string) { return string.asString().value_or(std::string_view()); }
 
+// A token of the server, given back at the end of the scope, however that is left.
+class HeldToken {
+ public:
+  HeldToken(ServerContext& server, std::uint32_t token) noexcept : server_(server), token_(token) {}
+  explicit HeldToken(ServerContext& server) : HeldToken(server, AcquireBusyToken(server)) {}
+  HeldToken(const HeldToken&) = delete;
+  HeldToken& operator=(const HeldToken&) = delete;
+  ~HeldToken() { (void)ReleaseBusyToken(server_, token_); }  // one bit, as it was given
+
+ private:
+  ServerContext& server_;
+  const std::uint32_t token_;
+};
+
 // For a log line.
 std::string shown(const PropertyList& string) { return string ? std::string(textOf(string)) : "(null)"; }
 
@@ -55,22 +69,28 @@ void LASDUpdater::checkForUpdate(ServerContext& server, std::uint32_t mask) {
   try {
     // Made here and not before, so that a process which never needs it does not pay for it.
     if (queue_ == nullptr) queue_ = parts_->queues.makeSerial(kQueueLabel, QualityOfService::standard);
-    queue_->post([self = std::move(self), &server, mask, token] { self->check(server, mask, token); });
+    queue_->post([self = std::move(self), &server, mask, token] {
+      const HeldToken held(server, token);
+      try {
+        self->check(server, mask);
+      } catch (const std::bad_alloc&) {
+        logUnified(LogLevel::error, "Update check given up: out of memory");
+      }
+    });
   } catch (const std::bad_alloc&) {
     (void)ReleaseBusyToken(server, token);  // one bit, as it was given: no check will do it
     throw;
   }
 }
 
-void LASDUpdater::check(ServerContext& server, std::uint32_t mask, std::uint32_t token) {
+void LASDUpdater::check(ServerContext& server, std::uint32_t mask) {
   loadVersions(kVersionsDomain, VersionSource::preferences, mask);
   const std::int64_t result = loadVersions(parts_->manifestUrl, VersionSource::manifest, mask);
   if (result != 0 && result != kNotFetched) {
     for (const std::int32_t type : kDatabaseTypesInOrder) {
       if ((result & type) == 0) continue;
-      const std::uint32_t own = AcquireBusyToken(server);
+      const HeldToken own(server);
       updateDatabase(type);
-      (void)ReleaseBusyToken(server, own);  // one bit, as it was given
     }
   } else if (result == 0) {
     logUnified(LogLevel::error, "No update required for any databases");
@@ -78,7 +98,6 @@ void LASDUpdater::check(ServerContext& server, std::uint32_t mask, std::uint32_t
   } else {
     sendNotification(parts_->messagePorts, makeNotification(NotificationKind::updateFailed, 0));
   }
-  (void)ReleaseBusyToken(server, token);  // likewise
 }
 
 std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource kind, std::uint32_t mask) {

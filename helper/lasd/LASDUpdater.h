@@ -72,7 +72,7 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
   void updateDatabase(std::int32_t type);
 
  private:
-  void check(ServerContext& server, std::uint32_t mask, std::uint32_t token);
+  void check(ServerContext& server, std::uint32_t mask);
 
   std::unique_ptr<Parts> parts_;
   // By type, the record found here or, once it needs an update, the server's; none when there is no record.

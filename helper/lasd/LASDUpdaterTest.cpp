@@ -362,6 +362,25 @@ TEST_F(LASDUpdaterTest, EachInstallHasABusyTokenOfItsOwn) {
   EXPECT_EQ(watching.masks, (std::vector<std::uint32_t>{3, 3, 1}));
 }
 
+TEST_F(LASDUpdaterTest, WithoutMemoryForARequestOrAQueueACheckFailsAndGivesItsTokensBack) {
+  serveAll("1.0");
+  web.exhausted = true;
+  check(kAll);
+  EXPECT_EQ(notifications(), std::vector<std::string>{"UpdateFailed"});
+  EXPECT_TRUE(logged(error("Cannot create HTTP request for URL " + kManifest)));
+  EXPECT_EQ(server.busyMask, 0U);
+  web.exhausted = false;
+  log.clear();
+  queues.refuseQueues = true;
+  check(kAll);
+  EXPECT_TRUE(logged(error("Update check given up: out of memory")));
+  EXPECT_EQ(notifications().size(), 1U);
+  EXPECT_EQ(server.busyMask, 0U);
+  queues.refuseQueues = false;
+  check(gsm);
+  EXPECT_EQ(notifications().back(), "UpdateAvailable gsm");
+}
+
 TEST_F(LASDUpdaterTest, ChecksRunOneAfterTheOther) {
   serveAll("1.0");
   updater->checkForUpdate(server, gsm);

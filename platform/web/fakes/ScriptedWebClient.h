@@ -8,6 +8,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <new>
 #include <span>
 #include <string>
 #include <string_view>
@@ -72,7 +73,13 @@ class ScriptedWebClient final : public WebClient {
     return seen_;
   }
 
-  std::shared_ptr<WebSession> makeSession() override { return std::make_shared<Session>(); }
+  // There is no memory for another session.
+  bool exhausted = false;
+
+  std::shared_ptr<WebSession> makeSession() override {
+    if (exhausted) throw std::bad_alloc();
+    return std::make_shared<Session>();
+  }
   std::shared_ptr<WebRequest> makeRequest(WebRequestType type, const std::string& url,
                                           const HeaderMap& headers,
                                           std::shared_ptr<WebSession> session) override {

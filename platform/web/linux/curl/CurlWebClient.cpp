@@ -157,7 +157,13 @@ struct CurlWebClient::Transfer {
     response->errorKind = kind;
     if (kind != WebErrorKind::none) response->body = {};
     if (callbackQueue == nullptr || !completion) return;
-    callbackQueue->post([done = std::move(completion), answer = std::move(response)] { done(answer); });
+    const auto done = std::make_shared<WebRequest::Completion>(std::move(completion));
+    const auto answer = std::move(response);
+    try {
+      callbackQueue->post([done, answer] { (*done)(answer); });
+    } catch (...) {
+      (*done)(answer);  // its thread cannot be started; better told on the wrong queue than never
+    }
     callbackQueue.reset();
   }
 
@@ -245,25 +251,33 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
     transfer->settings = &settings_;
     transfer->cellularAllowed = transfer->session == nullptr || transfer->session->cellularAllowed;
     if (transfer->timeLimit > milliseconds::zero()) transfer->deadline = Clock::now() + transfer->timeLimit;
+    auto kind = WebErrorKind::cancelled;
     {
       const std::lock_guard lock(mutex_);
       if (!closed_) {
-        queue_->post([self = shared_from_this(), transfer] { self->start(transfer); });
-        return;
+        try {
+          queue_->post([self = shared_from_this(), transfer] { self->start(transfer); });
+          used_ = true;
+          return;
+        } catch (...) {  // no memory, or no thread for our queue
+          kind = WebErrorKind::clientUnavailable;
+        }
       }
     }
-    transfer->finish(WebErrorKind::cancelled);
+    transfer->finish(kind);
   }
 
   // Completes what is under way as cancelled and ends the queue. Not on the queue.
   void shutDown() noexcept {
     std::shared_ptr<WorkQueue> queue;
+    bool used = false;
     {
       const std::lock_guard lock(mutex_);
       closed_ = true;
       queue = std::move(queue_);
+      used = used_;
     }
-    if (queue == nullptr) return;
+    if (queue == nullptr || !used) return;
     if (queue->isCurrent()) {
       abandonAll(WebErrorKind::cancelled);
       return;
@@ -571,8 +585,9 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
 
   const CurlSettings settings_;
   WorkQueue* const loop_;  // what queue_ owns, for use on it
-  std::mutex mutex_;       // guards the next two
+  std::mutex mutex_;       // guards the next three
   bool closed_ = false;
+  bool used_ = false;  // something has been submitted, so its thread runs
   std::shared_ptr<WorkQueue> queue_;
 
   std::map<curl_socket_t, std::unique_ptr<DescriptorSource>> sockets_;

@@ -11,6 +11,7 @@
 #include <fstream>
 #include <future>
 #include <optional>
+#include <system_error>
 
 #include "platform/net/fakes/PrivateNetwork.h"
 #include "platform/runloop/linux/SystemQueues.h"
@@ -48,11 +49,15 @@ class ShortQueue final : public WorkQueue {
   struct Refusals {
     std::atomic<bool> descriptors{false};
     std::atomic<bool> timers{false};
+    std::atomic<bool> tasks{false};
   };
   ShortQueue(std::shared_ptr<WorkQueue> real, Refusals& refusals)
       : real_(std::move(real)), refusals_(refusals) {}
   const std::string& label() const noexcept override { return real_->label(); }
-  void post(Task task) override { real_->post(std::move(task)); }
+  void post(Task task) override {
+    if (refusals_.tasks) throw std::system_error(EAGAIN, std::generic_category(), "thread");
+    real_->post(std::move(task));
+  }
   void postAfter(std::chrono::nanoseconds delay, Task task) override {
     real_->postAfter(delay, std::move(task));
   }
@@ -564,6 +569,29 @@ TEST_F(CurlWebClientTest, WithoutDescriptorsOrTimersToWorkWithRequestsCompleteAn
     *refused = false;
     EXPECT_EQ(textOf(*fetch(server.url())), "x");
   }
+  client.reset();
+}
+
+TEST_F(CurlWebClientTest, WithoutAThreadForItsOwnOrTheCallersQueueTheCompletionStillComes) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.respond("200 OK", "x");
+  });
+  ShortQueues shortQueues(queues);
+  client = CurlWebClient::make(shortQueues, settings);
+  shortQueues.refusals.tasks = true;
+  expectKind(WebErrorKind::clientUnavailable, fetch(server.url()));
+  shortQueues.refusals.tasks = false;
+
+  ShortQueue::Refusals refused;
+  refused.tasks = true;
+  const auto request = client->makeRequest(WebRequestType::get, server.url(), {}, client->makeSession());
+  request->setCallbackQueue(std::make_shared<ShortQueue>(callbackQueue, refused));
+  std::promise<std::shared_ptr<WebResponse>> answer;
+  request->setCompletion(
+      [&](std::shared_ptr<WebResponse> response) { answer.set_value(std::move(response)); });
+  request->send({});
+  EXPECT_EQ(textOf(*answer.get_future().get()), "x");
   client.reset();
 }
 
