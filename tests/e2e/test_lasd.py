@@ -175,9 +175,29 @@ class Updates(UpdateTest):
         self.logs.wait_for("unified", ERROR, "Could not create version dictionary from downloaded plist!")
 
     def test_an_update_without_a_url_is_not_announced(self):
-        self.serve({"gsm": "1", "umts": "1"}, umts="")
+        manifest = self.serve({"gsm": "1", "umts": "1", "lte": "1"}, umts="")
+        del manifest["lte"]["ContentURL"]
+        (self.server.root / "1/v3/lasd.plist").write_bytes(plistlib.dumps(manifest))
         self.assertEqual(self.check(), available(["gsm"]))
         self.logs.wait_for("unified", ERROR, "URL for umts database is empty")
+        self.logs.wait_for("unified", ERROR, "Could not find lte database URL")
+        # Only those two are left, so a second check brings nothing; the third shows that it has ended.
+        request_check(self.client_for_all(), ALL)
+        self.assertEqual(self.check(MASKS["gsm"]), ["NoUpdateRequired"])
+
+    def test_gzip_members_are_joined_and_a_cut_file_or_bytes_after_the_last_member_are_refused(self):
+        manifest = self.serve({name: "1" for name in ORDER})
+        content = self.server.root / "content"
+        whole = gzip.compress(self.content("gsm", "1"))
+        half = len(self.content("gsm", "1")) // 2
+        (content / "gsm.db.gz").write_bytes(gzip.compress(self.content("gsm", "1")[:half]) + gzip.compress(b"")
+                                            + gzip.compress(self.content("gsm", "1")[half:]))
+        (content / "umts.db.gz").write_bytes(whole[:-1])
+        (content / "cdma.db.gz").write_bytes(whole + b"trailing bytes")
+        (content / "lte.db.gz").write_bytes(whole + gzip.compress(b"cut")[:-4])
+        self.assertEqual(self.check(count=5), ["UpdateAvailable gsm", "UpdateFailed", "UpdateFailed", "UpdateFailed",
+                                               "UpdateAvailable scdma"])
+        self.assert_installed({name: manifest[name] for name in ("gsm", "scdma")})
 
     def test_with_nobody_at_the_message_port_a_check_completes(self):
         path = pathlib.Path(wire.BOOTSTRAP) / self.port.NAME
