@@ -16,7 +16,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/base/ProcessStartTime.h"
+#include "platform/base/ProcessFacts.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/security/fakes/FakeTaskSecurity.h"

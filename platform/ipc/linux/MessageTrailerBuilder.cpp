@@ -6,13 +6,14 @@
 #include <poll.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <charconv>
 #include <cstdio>
 #include <string_view>
 
-#include "platform/base/ProcessStartTime.h"
+#include "platform/base/ProcessFacts.h"
 #include "platform/base/UniqueFd.h"
 
 #ifndef SO_PEERPIDFD
@@ -43,15 +44,16 @@ MessageTrailer buildTrailer(const ucred& sender, std::uint32_t sequence) noexcep
   trailer.sequence = sequence;
   trailer.senderUid = sender.uid;
   trailer.senderGid = sender.gid;
-  const pid_t session = sender.pid > 0 ? ::getsid(sender.pid) : -1;
+  const ProcessFacts facts =
+      sender.pid > 0 ? processFacts(sender.pid).value_or(ProcessFacts{}) : ProcessFacts{};
   const std::array<std::uint32_t, 8> token{sender.pid > 0 ? loginUid(sender.pid) : kNoLoginUid,
                                            sender.uid,
                                            sender.gid,
                                            sender.uid,
                                            sender.gid,
                                            static_cast<std::uint32_t>(sender.pid),
-                                           session > 0 ? static_cast<std::uint32_t>(session) : 0,
-                                           sender.pid > 0 ? processStartTime(sender.pid).value_or(0) : 0};
+                                           static_cast<std::uint32_t>(std::max(facts.session, 0)),
+                                           facts.startTime};
   for (std::size_t i = 0; i < token.size(); ++i) trailer.auditToken[i] = token[i];
   return trailer;
 }
@@ -62,7 +64,7 @@ MessageTrailer minimalTrailer() noexcept {
   return trailer;
 }
 
-PeerPin pinPeer(int connection, pid_t sender) noexcept {
+PeerPin pinPeer(int connection, pid_t peer, pid_t sender) noexcept {
   int raw = -1;
   socklen_t size = sizeof raw;
   if (::getsockopt(connection, SOL_SOCKET, SO_PEERPIDFD, &raw, &size) != 0) {
@@ -71,10 +73,7 @@ PeerPin pinPeer(int connection, pid_t sender) noexcept {
   const UniqueFd pidfd(raw);
   pollfd gone{pidfd.get(), POLLIN, 0};
   if (::poll(&gone, 1, 0) != 0) return PeerPin::refused;  // readable: the process has exited
-  ucred peer{};
-  size = sizeof peer;
-  if (::getsockopt(connection, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) return PeerPin::refused;
-  return peer.pid == sender ? PeerPin::confirmed : PeerPin::refused;
+  return peer > 0 && peer == sender ? PeerPin::confirmed : PeerPin::refused;
 }
 
 }  // namespace brenvik

@@ -20,8 +20,8 @@ MessageTrailer minimalTrailer() noexcept;
 
 // Whether the process that sent a message is the one that made the connection, where the kernel can say
 // (SO_PEERPIDFD, Linux 6.5): `unsupported` where it cannot, `refused` when it names another process or one
-// that has gone.
+// that has gone. `peer` is the connection's (SO_PEERCRED).
 enum class PeerPin { confirmed, unsupported, refused };
-PeerPin pinPeer(int connection, pid_t sender) noexcept;
+PeerPin pinPeer(int connection, pid_t peer, pid_t sender) noexcept;
 
 }  // namespace brenvik

@@ -4,6 +4,7 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
+#include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -36,6 +37,15 @@ bool isAlive(const sockaddr_un& address) noexcept {
   return errno == EAGAIN || errno == EPROTOTYPE;
 }
 
+bool isListeningPort(int fd) noexcept {
+  const auto has = [fd](int option, int wanted) {
+    int value = -1;
+    socklen_t size = sizeof value;
+    return ::getsockopt(fd, SOL_SOCKET, option, &value, &size) == 0 && value == wanted;
+  };
+  return has(SO_DOMAIN, AF_UNIX) && has(SO_TYPE, SOCK_SEQPACKET) && has(SO_ACCEPTCONN, 1);
+}
+
 bool lockWithin(int fd) noexcept {
   for (int i = 0; i < kLockTries; ++i) {
     if (::flock(fd, LOCK_EX | LOCK_NB) == 0) return true;
@@ -57,7 +67,7 @@ UniqueFd SystemBootstrap::fromServiceManager(const char* serviceName) noexcept {
     if (!ours || chosen.isValid()) {
       logUnified(LogLevel::error, "passed over a listening descriptor named \"%s\"",
                  names != nullptr ? names[i] : "");
-    } else if (sd_is_socket_unix(given.get(), SOCK_SEQPACKET, 1, nullptr, 0) <= 0) {
+    } else if (!isListeningPort(given.get())) {
       logUnified(LogLevel::error, "the descriptor named \"%s\" is no listening SOCK_SEQPACKET socket",
                  serviceName);
     } else {
@@ -126,8 +136,7 @@ KernelReturn SystemBootstrap::checkIn(const char* serviceName, PortName* receive
     // Before the first accept: a message that is already there would otherwise come without credentials.
     const int on = 1;
     if (::setsockopt(socket.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0) return kern::failure;
-    const int flags = ::fcntl(socket.get(), F_GETFL);
-    if (flags < 0 || ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK) != 0) return kern::failure;
+    if (::ioctl(socket.get(), FIONBIO, &on) != 0) return kern::failure;
     *receiveRight = ports_.adoptService(std::move(socket), std::move(path));
     return *receiveRight == kNullPort ? kern::resourceShortage : kern::success;
   } catch (const std::bad_alloc&) {

@@ -48,26 +48,37 @@ struct OutgoingReply {
 
 enum class Sent { done, channelFull, failed };
 
-Sent sendReply(int fd, OutgoingReply& reply) noexcept {
-  std::array<iovec, 2> io{iovec{reply.bytes.data(), reply.size}, iovec{reply.region, reply.regionLength}};
-  msghdr message{};
-  message.msg_iov = io.data();
-  message.msg_iovlen = reply.region != nullptr ? 2 : 1;
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
+ssize_t sendOnce(int fd, OutgoingReply& reply) noexcept {
+  constexpr int kFlags = MSG_DONTWAIT | MSG_NOSIGNAL;
   const int passed =
       reply.memfd.isValid() ? reply.memfd.get() : (reply.right != nullptr ? reply.right->get() : -1);
-  if (passed >= 0) {
-    message.msg_control = control.data();
-    message.msg_controllen = control.size();
-    cmsghdr* const item = CMSG_FIRSTHDR(&message);
-    item->cmsg_level = SOL_SOCKET;
-    item->cmsg_type = SCM_RIGHTS;
-    item->cmsg_len = CMSG_LEN(sizeof(int));
-    std::memcpy(CMSG_DATA(item), &passed, sizeof passed);
+  if (passed < 0) {
+    if (reply.region == nullptr) return ::send(fd, reply.bytes.data(), reply.size, kFlags);
+    // One piece: a second costs the kernel as much as the rest of the call.
+    static_assert(sizeof(OutOfLineReply) == SystemRegions::kRoomForMessage);
+    auto* const datagram = static_cast<std::byte*>(reply.region) - SystemRegions::kRoomForMessage;
+    std::memcpy(datagram, reply.bytes.data(), SystemRegions::kRoomForMessage);
+    return ::send(fd, datagram, SystemRegions::kRoomForMessage + reply.regionLength, kFlags);
   }
+  iovec io{reply.bytes.data(), reply.size};
+  msghdr message{};
+  message.msg_iov = &io;
+  message.msg_iovlen = 1;
+  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
+  message.msg_control = control.data();
+  message.msg_controllen = control.size();
+  cmsghdr* const item = CMSG_FIRSTHDR(&message);
+  item->cmsg_level = SOL_SOCKET;
+  item->cmsg_type = SCM_RIGHTS;
+  item->cmsg_len = CMSG_LEN(sizeof(int));
+  std::memcpy(CMSG_DATA(item), &passed, sizeof passed);
+  return ::sendmsg(fd, &message, kFlags);
+}
+
+Sent sendReply(int fd, OutgoingReply& reply) noexcept {
   ssize_t sent = 0;
   do {
-    sent = ::sendmsg(fd, &message, MSG_DONTWAIT | MSG_NOSIGNAL);
+    sent = sendOnce(fd, reply);
   } while (sent < 0 && errno == EINTR);
   if (sent >= 0) return Sent::done;
   // ENOBUFS and ENOMEM pass as a full channel does; ETOOMANYREFS: too many descriptors on their way already.
@@ -134,7 +145,9 @@ class Channel : public std::enable_shared_from_this<Channel> {
   }
 
   bool isAdmitted = false;
+  // Of the process that made the connection.
   uid_t account = 0;
+  pid_t peer = 0;
 
  private:
   void end() noexcept {
@@ -190,7 +203,7 @@ void Channel::serve() noexcept {
   } else if (handler == nullptr) {
     reply.setStatus(mig::badId);
   } else if (owner_->wantTrailer() == WantTrailer::yes && incoming_.sender() &&
-             pinPeer(fd_->get(), incoming_.sender()->pid) == PeerPin::refused) {
+             pinPeer(fd_->get(), peer, incoming_.sender()->pid) == PeerPin::refused) {
     reply.setStatus(kern::invalidSecurity);
   } else {
     const MessageTrailer trailer = owner_->wantTrailer() == WantTrailer::yes && incoming_.sender()
@@ -322,13 +335,13 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
         ports_(ports),
         regions_(regions),
         incoming_(incoming),
-        listening_(std::move(listening)),
-        spare_(openSpare()) {}
+        listening_(std::move(listening)) {}
   ~ServiceSource() override { invalidate(); }
 
   bool addTo(RunLoop& loop) noexcept override {
     try {
       loop_ = &loop;
+      keepSpare();
       source_ = loop.addDescriptor(listening_->get(), EPOLLIN, [this](std::uint32_t) { acceptReady(); });
       return source_ != nullptr;
     } catch (const std::bad_alloc&) {
@@ -337,6 +350,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   }
   void invalidate() noexcept override {
     source_.reset();
+    spare_.reset();
     for (const auto& channel : channels_) channel->close();
     channels_.clear();
   }
@@ -352,9 +366,17 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
         [&channel](const std::shared_ptr<Channel>& other) { return other.get() == &channel; });
   }
 
-  static UniqueFd openSpare() noexcept { return UniqueFd(::open("/dev/null", O_RDONLY | O_CLOEXEC)); }
-
   void acceptReady() noexcept {
+    acceptWaiting();
+    keepSpare();
+  }
+
+  // Any descriptor will do: what counts is its place.
+  void keepSpare() noexcept {
+    if (!spare_.isValid()) spare_.reset(::fcntl(listening_->get(), F_DUPFD_CLOEXEC, 0));
+  }
+
+  void acceptWaiting() noexcept {
     for (int i = 0; i < kAcceptBudget; ++i) {
       UniqueFd connection(::accept4(listening_->get(), nullptr, nullptr, SOCK_CLOEXEC));
       if (connection.isValid()) {
@@ -381,7 +403,6 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   }
 
   void serve(UniqueFd connection) {
-    if (!spare_.isValid()) spare_ = openSpare();
     // A connection made before the listening socket asked for credentials (a client that started this
     // process) has not taken that over on every kernel.
     const int on = 1;
@@ -395,6 +416,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
         std::make_shared<Channel>(static_cast<ChannelOwner&>(*this), ports_, regions_, incoming_,
                                   std::make_shared<const UniqueFd>(std::move(connection)));
     channel->account = peer.uid;
+    channel->peer = peer.pid;
     if (!channel->addTo(*loop_)) return;
     channels_.push_back(channel);
     const auto unadmitted = [](const std::shared_ptr<Channel>& other) { return !other->isAdmitted; };

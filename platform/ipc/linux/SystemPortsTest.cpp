@@ -811,7 +811,7 @@ TEST_F(ServiceTest, MessagesOfTheServicePortCarryTheKernelsWordOnTheirSender) {
 TEST_F(ServiceTest, AMessageOfAnotherProcessThanTheConnectionsIsRefusedWith35WhereTheKernelCanTell) {
   listen();
   const UniqueFd connection = connect();
-  if (pinPeer(connection.get(), ::getpid()) == PeerPin::unsupported) {
+  if (pinPeer(connection.get(), ::getpid(), ::getpid()) == PeerPin::unsupported) {
     GTEST_SKIP() << "this kernel has no SO_PEERPIDFD (Linux 6.5)";
   }
   const pid_t child = ::fork();
@@ -831,7 +831,7 @@ TEST_F(ServiceTest, AMessageOfAnotherProcessThanTheConnectionsIsRefusedWith35Whe
 TEST_F(ServiceTest, AConnectionWhosePeerIsGoneIsRefusedWhereTheKernelCanTell) {
   listen();
   const UniqueFd probe = connect();
-  if (pinPeer(probe.get(), ::getpid()) == PeerPin::unsupported) {
+  if (pinPeer(probe.get(), ::getpid(), ::getpid()) == PeerPin::unsupported) {
     GTEST_SKIP() << "this kernel has no SO_PEERPIDFD (Linux 6.5)";
   }
   const pid_t child = ::fork();

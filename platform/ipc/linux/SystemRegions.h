@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdlib>
 #include <memory>
 #include <vector>
 
@@ -11,13 +12,14 @@
 
 namespace brenvik {
 
-// Regions for replies. One that fits a datagram beside its message is plain memory (the last one freed is
-// kept for the next); a larger one is written straight into a memfd (memfd_create(2)) that will travel as it
-// is.
+// Regions for replies. One that fits a datagram beside its message is plain memory, with room in front for
+// the message, so that both go out as one piece (the last one freed is kept for the next); a larger one is
+// written straight into a memfd (memfd_create(2)) that will travel as it is.
 class SystemRegions final : public RegionAllocator {
  public:
   // Longest region that travels in the same datagram as an out-of-line reply, in bytes.
-  static constexpr std::size_t kLongestInLine = kLargestDatagram - 56;
+  static constexpr std::size_t kRoomForMessage = 56;
+  static constexpr std::size_t kLongestInLine = kLargestDatagram - kRoomForMessage;
 
   KernelReturn allocate(void** address, std::size_t length) noexcept override;
   void deallocate(void* address, std::size_t length) noexcept override;
@@ -35,7 +37,10 @@ class SystemRegions final : public RegionAllocator {
     std::size_t length;
     UniqueFd memfd;
   };
-  std::unique_ptr<std::byte[]> spare_;
+  struct Freed {
+    void operator()(std::byte* datagram) const noexcept { std::free(datagram); }
+  };
+  std::unique_ptr<std::byte, Freed> spare_;  // a whole datagram
   std::size_t liveSmall_ = 0;
   std::vector<Large> large_;
 };

@@ -8,14 +8,14 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
+#include <climits>
+#include <new>
+#include <utility>
 
 namespace brenvik {
 namespace {
-
-// Descriptors are served before a timer that is due at the same moment: a check-in that has arrived beats the
-// idle countdown.
-constexpr std::int64_t kTimerPriority = SD_EVENT_PRIORITY_NORMAL + 10;
 
 // Counts while the system sleeps, as a person's idea of "ten seconds later" does.
 constexpr clockid_t kClock = CLOCK_BOOTTIME;
@@ -25,6 +25,13 @@ std::uint64_t nowMicroseconds() noexcept {
   ::clock_gettime(kClock, &now);
   return static_cast<std::uint64_t>(now.tv_sec) * 1'000'000U +
          static_cast<std::uint64_t>(now.tv_nsec) / 1'000U;
+}
+
+// Rounded up, so that nobody waits in a circle for the last fraction; the longest that can be said else.
+int toMilliseconds(std::uint64_t microseconds) noexcept {
+  if (microseconds == UINT64_MAX) return -1;
+  return static_cast<int>(
+      std::min<std::uint64_t>(microseconds / 1'000U + (microseconds % 1'000U != 0), INT_MAX));
 }
 
 // Rounded up, so that nothing fires early.
@@ -66,68 +73,114 @@ class EventLoop::TimerHandle final : public LoopSource {
   const std::shared_ptr<Timer> timer_;
 };
 
-class EventLoop::Descriptor final : public DescriptorSource {
+// The epoll set. A source that outlives the loop still finds it.
+class EventLoop::DescriptorSet {
  public:
-  explicit Descriptor(RunLoop::DescriptorHandler handler)
-      : state_(std::make_shared<State>(State{std::move(handler), {}})) {}
-  ~Descriptor() override { invalidate(); }
+  struct Entry {
+    int fd;
+    RunLoop::DescriptorHandler handler;
+  };
 
-  bool watch(sd_event* event, int fd, std::uint32_t events) noexcept {
-    sd_event_source* source = nullptr;
-    if (sd_event_add_io(event, &source, fd, events, &Descriptor::handle, state_.get()) < 0) return false;
-    state_->source.reset(source);
-    return true;
+  bool make() noexcept {
+    epoll_.reset(::epoll_create1(EPOLL_CLOEXEC));
+    return epoll_.isValid();
   }
-  void invalidate() noexcept override { state_->source.reset(); }
-  bool setEvents(std::uint32_t events) noexcept override {
-    return state_->source != nullptr && sd_event_source_set_io_events(state_->source.get(), events) >= 0;
+  bool control(int operation, Entry& entry, std::uint32_t events) noexcept {
+    epoll_event interest{};
+    interest.events = events;
+    interest.data.ptr = &entry;
+    return ::epoll_ctl(epoll_.get(), operation, entry.fd, &interest) == 0;
+  }
+  int wait(epoll_event* ready, int most, int milliseconds) noexcept {
+    const int count = ::epoll_wait(epoll_.get(), ready, most, milliseconds);
+    return count < 0 ? -errno : count;
+  }
+  void handle(Entry* entry, std::uint32_t events) {
+    handling_ = entry;
+    entry->handler(events);
+    handling_ = nullptr;
+    gone_.reset();
+  }
+  // An entry whose handler runs lives until that returns.
+  void retire(std::unique_ptr<Entry> entry) noexcept {
+    if (entry.get() == handling_) gone_ = std::move(entry);
   }
 
  private:
-  // Kept alive through a handler that destroys its own source.
-  struct State : std::enable_shared_from_this<State> {
-    State(RunLoop::DescriptorHandler h, SourcePointer s) : handler(std::move(h)), source(std::move(s)) {}
-    RunLoop::DescriptorHandler handler;
-    SourcePointer source;
-  };
-  static int handle(sd_event_source*, int, std::uint32_t events, void* userdata) noexcept {
-    const auto state = static_cast<State*>(userdata)->shared_from_this();
-    state->handler(events);
-    return 0;
-  }
-  const std::shared_ptr<State> state_;
+  UniqueFd epoll_;
+  Entry* handling_ = nullptr;
+  std::unique_ptr<Entry> gone_;
 };
 
-std::shared_ptr<EventLoop> EventLoop::make(For whom) {
+class EventLoop::Descriptor final : public DescriptorSource {
+ public:
+  Descriptor(std::shared_ptr<DescriptorSet> set, int fd, RunLoop::DescriptorHandler handler)
+      : set_(std::move(set)), entry_(new DescriptorSet::Entry{fd, std::move(handler)}) {}
+  ~Descriptor() override { invalidate(); }
+
+  bool watch(std::uint32_t events) noexcept {
+    watched_ = set_->control(EPOLL_CTL_ADD, *entry_, events);
+    return watched_;
+  }
+  const DescriptorSet::Entry* entry() const noexcept { return entry_.get(); }
+  void invalidate() noexcept override {
+    if (std::exchange(watched_, false)) (void)set_->control(EPOLL_CTL_DEL, *entry_, 0);
+    if (entry_ != nullptr) set_->retire(std::move(entry_));
+  }
+  bool setEvents(std::uint32_t events) noexcept override {
+    return watched_ && set_->control(EPOLL_CTL_MOD, *entry_, events);
+  }
+
+ private:
+  const std::shared_ptr<DescriptorSet> set_;
+  std::unique_ptr<DescriptorSet::Entry> entry_;
+  bool watched_ = false;
+};
+
+std::shared_ptr<EventLoop> EventLoop::make(For whom) try {
   std::shared_ptr<EventLoop> loop(new EventLoop);
   if (whom == For::thisThread) loop->thread_ = std::this_thread::get_id();
-  sd_event* event = nullptr;
-  if (sd_event_new(&event) < 0) return nullptr;
-  loop->event_.reset(event);
+  loop->descriptors_ = std::make_shared<DescriptorSet>();
+  if (!loop->descriptors_->make()) return nullptr;
   loop->wakeFd_.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
   if (!loop->wakeFd_.isValid()) return nullptr;
-  sd_event_source* source = nullptr;
-  const auto onWake = [](sd_event_source*, int fd, std::uint32_t, void* userdata) noexcept {
+  loop->wakeSource_ = loop->addDescriptor(loop->wakeFd_.get(), EPOLLIN, [raw = loop.get()](std::uint32_t) {
     std::uint64_t count = 0;
-    (void)!::read(fd, &count, sizeof count);  // only to make it unreadable again
-    static_cast<EventLoop*>(userdata)->drainInbox();
-    return 0;
-  };
-  if (sd_event_add_io(event, &source, loop->wakeFd_.get(), EPOLLIN, onWake, loop.get()) < 0) return nullptr;
-  loop->wakeSource_.reset(source);
+    (void)!::read(raw->wakeFd_.get(), &count, sizeof count);  // only to make it unreadable again
+    raw->drainInbox();
+  });
+  if (loop->wakeSource_ == nullptr) return nullptr;
   if (whom == For::anotherThread) {
     // The library opens a clock's descriptor for its first timer and keeps it: later might be too late.
-    if (sd_event_add_time(event, &source, kClock, UINT64_MAX, 1, &EventLoop::onTime, nullptr) < 0) {
+    sd_event_source* source = nullptr;
+    if (!loop->makeTimers() || sd_event_add_time(loop->timers_.get(), &source, kClock, UINT64_MAX, 1,
+                                                 &EventLoop::onTime, nullptr) < 0) {
       return nullptr;
     }
     sd_event_source_disable_unref(source);
   }
   return loop;
+} catch (const std::bad_alloc&) {
+  return nullptr;
 }
 
 EventLoop::~EventLoop() {
   // A timer's source holds a reference to the loop's event object.
   for (auto& [raw, timer] : armed_) timer->source.reset();
+}
+
+bool EventLoop::makeTimers() noexcept {
+  if (timers_ != nullptr) return true;
+  sd_event* event = nullptr;
+  if (sd_event_new(&event) < 0) return false;
+  std::unique_ptr<sd_event, Unref> timers(event);
+  try {
+    timersSource_ = addDescriptor(sd_event_get_fd(event), EPOLLIN, [](std::uint32_t) {});
+  } catch (const std::bad_alloc&) {
+  }
+  if (timersSource_ == nullptr) return false;
+  timers_ = std::move(timers);
+  return true;
 }
 
 bool EventLoop::onLoopThread() const noexcept {
@@ -138,7 +191,52 @@ void EventLoop::leaveToAnotherThread() noexcept { thread_.store({}, std::memory_
 
 int EventLoop::runOnce(std::uint64_t timeOut) noexcept {
   thread_.store(std::this_thread::get_id(), std::memory_order_relaxed);
-  return sd_event_run(event_.get(), timeOut);
+  for (;;) {
+    if (timers_ != nullptr && (!timersPrepared_ || timersChanged_)) {
+      // One that is prepared takes no notice of a change before it has waited, too.
+      if (timersPrepared_ && handleTimer() > 0) return 1;
+      timersChanged_ = false;
+      const int due = sd_event_prepare(timers_.get());
+      if (due < 0) return due;
+      if (due > 0) {
+        (void)sd_event_dispatch(timers_.get());
+        return 1;
+      }
+      timersPrepared_ = true;
+    }
+    // One at a time: what is ready and not handled now goes to the end of the kernel's queue, and a handler
+    // may end the watching of any other.
+    epoll_event ready{};
+    int count = descriptors_->wait(&ready, 1, toMilliseconds(timeOut));
+    if (count == -EINTR) continue;
+    if (count <= 0) return count;
+    const auto isTimers = [this](const epoll_event& event) {
+      return timersSource_ != nullptr &&
+             event.data.ptr == static_cast<const Descriptor*>(timersSource_.get())->entry();
+    };
+    if (isTimers(ready)) {
+      // A descriptor that is ready at the same moment goes first: a check-in that has arrived beats the idle
+      // countdown.
+      std::array<epoll_event, 2> both{};
+      count = descriptors_->wait(both.data(), static_cast<int>(both.size()), 0);
+      const auto other = std::find_if_not(both.begin(), both.begin() + std::max(count, 0), isTimers);
+      if (other == both.begin() + std::max(count, 0)) {
+        if (handleTimer() > 0) return 1;
+        continue;
+      }
+      ready = *other;
+    }
+    descriptors_->handle(static_cast<DescriptorSet::Entry*>(ready.data.ptr), ready.events);
+    return 1;
+  }
+}
+
+// Handles the timer that is due, if one is: 1.
+int EventLoop::handleTimer() noexcept {
+  timersPrepared_ = false;
+  if (sd_event_wait(timers_.get(), 0) <= 0) return 0;
+  (void)sd_event_dispatch(timers_.get());
+  return 1;
 }
 
 void EventLoop::wake() noexcept {
@@ -171,8 +269,8 @@ void EventLoop::drainInbox() noexcept {
 
 std::unique_ptr<DescriptorSource> EventLoop::addDescriptor(int fd, std::uint32_t events,
                                                            RunLoop::DescriptorHandler handler) {
-  auto descriptor = std::make_unique<Descriptor>(std::move(handler));
-  if (!descriptor->watch(event_.get(), fd, events)) return nullptr;
+  auto descriptor = std::make_unique<Descriptor>(descriptors_, fd, std::move(handler));
+  if (!descriptor->watch(events)) return nullptr;
   return descriptor;
 }
 
@@ -196,17 +294,19 @@ int EventLoop::onTime(sd_event_source* source, std::uint64_t, void* userdata) no
 
 bool EventLoop::arm(const std::shared_ptr<Timer>& timer) noexcept {
   sd_event_source* source = nullptr;
-  if (sd_event_add_time(event_.get(), &source, kClock, timer->next, timer->leeway, &EventLoop::onTime,
+  if (!makeTimers()) return false;
+  timersChanged_ = true;
+  if (sd_event_add_time(timers_.get(), &source, kClock, timer->next, timer->leeway, &EventLoop::onTime,
                         timer.get()) < 0) {
     return false;
   }
   timer->source.reset(source);
-  sd_event_source_set_priority(source, kTimerPriority);
   armed_.emplace(timer.get(), timer);
   return true;
 }
 
 void EventLoop::disarm(Timer& timer) noexcept {
+  timersChanged_ = true;
   timer.source.reset();
   armed_.erase(&timer);
 }

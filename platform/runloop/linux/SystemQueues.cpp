@@ -9,15 +9,15 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <functional>
 #include <mutex>
 #include <system_error>
 #include <thread>
 #include <utility>
-#include <vector>
 
-#include "platform/base/ProcessStartTime.h"
+#include "platform/base/ProcessFacts.h"
 
 namespace brenvik {
 namespace {
@@ -146,31 +146,26 @@ class ThreadQueue final : public SystemQueue {
   std::thread thread_;
 };
 
-// Descriptors kept back for queues. Any thread.
-class DescriptorReserve {
+// The process's limit of descriptors, raised while this stands by what queues need; not beyond the hard
+// limit.
+class RaisedLimit {
  public:
-  explicit DescriptorReserve(std::size_t count) : kept_(count) { fill(); }
-  // Takes back what is missing, as far as there are descriptors.
-  void fill() noexcept {
-    const std::lock_guard lock(mutex_);
-    for (UniqueFd& fd : kept_) {
-      if (!fd.isValid()) fd.reset(::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, 0));
-    }
+  RaisedLimit() noexcept {
+    if (::getrlimit(RLIMIT_NOFILE, &before_) != 0) return;
+    rlimit raised = before_;
+    raised.rlim_cur = std::min(before_.rlim_cur + SystemQueues::kReservedDescriptors, before_.rlim_max);
+    raised_ = raised.rlim_cur > before_.rlim_cur && ::setrlimit(RLIMIT_NOFILE, &raised) == 0;
   }
-  // Gives up to `count` descriptors free.
-  void spend(int count) noexcept {
-    const std::lock_guard lock(mutex_);
-    for (UniqueFd& fd : kept_) {
-      if (count == 0) return;
-      if (!fd.isValid()) continue;
-      fd.reset();
-      --count;
-    }
+  // What was made above the limit stays.
+  ~RaisedLimit() {
+    if (raised_) (void)::setrlimit(RLIMIT_NOFILE, &before_);
   }
+  RaisedLimit(const RaisedLimit&) = delete;
+  RaisedLimit& operator=(const RaisedLimit&) = delete;
 
  private:
-  std::mutex mutex_;
-  std::vector<UniqueFd> kept_;
+  rlimit before_{};
+  bool raised_ = false;
 };
 
 }  // namespace
@@ -178,25 +173,16 @@ class DescriptorReserve {
 // Makes the serial queues and, when it is first wanted, the global one.
 class SystemQueues::Maker {
  public:
-  Maker() : reserve_(std::make_shared<DescriptorReserve>(kReserved)) {}
-
   std::shared_ptr<WorkQueue> make(std::string label, QualityOfService qualityOfService) {
     auto loop = EventLoop::make(EventLoop::For::anotherThread);
-    // Another thread may be faster at taking what the reserve lets go of: as often as it can let go.
-    for (int i = 0; loop == nullptr && i < kReservedQueues; ++i) {
-      reserve_->spend(EventLoop::kDescriptorsForAnotherThread);
+    if (loop == nullptr) {
+      static std::mutex oneAtATime;  // the limit is the process's
+      const std::lock_guard lock(oneAtATime);
+      const RaisedLimit limit;
       loop = EventLoop::make(EventLoop::For::anotherThread);
     }
-    if (loop == nullptr) {
-      reserve_->fill();
-      throw OutOfQueues();
-    }
-    // What the queue gives back goes to the reserve first.
-    const auto destroy = [reserve = reserve_](ThreadQueue* queue) {
-      delete queue;
-      reserve->fill();
-    };
-    return {new ThreadQueue(std::move(loop), std::move(label), qualityOfService), destroy};
+    if (loop == nullptr) throw OutOfQueues();
+    return std::make_shared<ThreadQueue>(std::move(loop), std::move(label), qualityOfService);
   }
   WorkQueue& global() {
     const std::lock_guard lock(mutex_);
@@ -205,12 +191,12 @@ class SystemQueues::Maker {
   }
 
  private:
-  static constexpr std::size_t kReserved =
-      std::size_t{kReservedQueues} * std::size_t{EventLoop::kDescriptorsForAnotherThread};
-  const std::shared_ptr<DescriptorReserve> reserve_;
   std::mutex mutex_;
   std::shared_ptr<WorkQueue> global_;
 };
+
+static_assert(SystemQueues::kReservedDescriptors == 9 * EventLoop::kDescriptorsForAnotherThread,
+              "as many queues as the helper ever has at a time");
 
 namespace {
 

@@ -35,12 +35,12 @@ class SystemRunLoop final : public RunLoop {
 
 // Queues on threads of their own, and the main queue on the main run loop. A process-exit source is a pidfd
 // (pidfd_open(2)) watched by the main run loop: the global queue's thread starts when there is something to
-// tell. Descriptors for kReservedQueues queues are kept back, so that clients who use up all others do not
-// keep the process's own work from starting.
+// tell. A queue may go kReservedDescriptors beyond the process's soft limit (RLIMIT_NOFILE), where the hard
+// one lets it: clients who use up everything else do not keep the process's own work from starting.
 class SystemQueues final : public WorkQueues {
  public:
-  // As many as the helper ever has at a time.
-  static constexpr int kReservedQueues = 9;
+  // What a process should leave between its soft limit and the hard one.
+  static constexpr unsigned kReservedDescriptors = 36;
 
   // The run loop must outlive this object.
   explicit SystemQueues(SystemRunLoop& mainLoop);

@@ -7,7 +7,6 @@
 #include <unistd.h>
 
 #include <array>
-#include <charconv>
 
 namespace brenvik {
 namespace {
@@ -23,25 +22,6 @@ std::string_view takeLine(std::string_view* text) noexcept {
 }
 
 }  // namespace
-
-std::optional<ProcessFacts> parseProcessStat(std::string_view text) noexcept {
-  // The program's name, field 2, is in brackets, is the process's own choice and may hold brackets and
-  // blanks: count from its end.
-  const std::size_t nameEnd = text.rfind(')');
-  if (nameEnd == std::string_view::npos) return std::nullopt;
-  std::string_view rest = text.substr(nameEnd + 1);
-  ProcessFacts facts;
-  for (int field = 3; field <= 22; ++field) {
-    const std::size_t blank = rest.find(' ');
-    if (blank == std::string_view::npos) return std::nullopt;
-    rest.remove_prefix(blank + 1);
-    if (field == 3 && !rest.empty()) facts.state = rest.front();
-  }
-  std::uint64_t ticks = 0;
-  if (std::from_chars(rest.data(), rest.data() + rest.size(), ticks).ec != std::errc()) return std::nullopt;
-  facts.startTime = static_cast<std::uint32_t>(ticks);
-  return facts;
-}
 
 std::string_view unitOfCgroups(std::string_view text) noexcept {
   std::string_view path;

@@ -9,17 +9,10 @@
 #include <string>
 #include <string_view>
 
+#include "platform/base/ProcessFacts.h"
 #include "platform/base/UniqueFd.h"
 
 namespace brenvik {
-
-// What of /proc/PID/stat (proc(5)) says which process it is and whether it still runs.
-struct ProcessFacts {
-  char state = '?';             // field 3
-  std::uint32_t startTime = 0;  // field 22, low 32 bits
-};
-// Nothing when the text is not of that form.
-std::optional<ProcessFacts> parseProcessStat(std::string_view text) noexcept;
 
 // The last component of the process's path in the unified hierarchy ("0::" line) of /proc/PID/cgroup
 // (cgroups(7)), or, where there is no such line, in the hierarchy named systemd. Empty when there is none.

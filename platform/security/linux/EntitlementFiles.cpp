@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <new>
 #include <optional>
@@ -27,10 +28,25 @@ constexpr std::size_t kLargestFile = std::size_t{1} << 20;
 constexpr std::string_view kSuffix = ".plist";
 constexpr std::string_view kDefaultUser = "root";
 
-struct DirectoryCloser {
-  void operator()(DIR* directory) const noexcept { ::closedir(directory); }
-};
-using Directory = std::unique_ptr<DIR, DirectoryCloser>;
+// The names in a directory that may be entitlement files, in order; nothing when it cannot be read. Without
+// readdir(3), which asks three more questions of the system at every first check-in.
+std::optional<std::vector<std::string>> entitlementFilesIn(int directory) {
+  std::vector<std::string> names;
+  alignas(dirent64) std::array<char, 4096> entries;
+  for (;;) {
+    const ssize_t size = ::getdents64(directory, entries.data(), entries.size());
+    if (size < 0) return std::nullopt;
+    if (size == 0) break;
+    for (ssize_t at = 0; at < size;) {
+      const auto* const entry = reinterpret_cast<const dirent64*>(entries.data() + at);
+      const std::string_view name = entry->d_name;
+      if (name.ends_with(kSuffix) && !name.starts_with('.')) names.emplace_back(name);
+      at += entry->d_reclen;
+    }
+  }
+  std::sort(names.begin(), names.end());
+  return names;
+}
 
 // Only the superuser can have put it there or changed it.
 bool isTrusted(const struct stat& facts) noexcept {
@@ -115,7 +131,7 @@ class EntitlementFiles::Task final : public SecurityTask {
  private:
   // Both return true when the question is settled, one way or the other.
   bool lookInDirectory(const std::string& directory, std::string_view name, Answer* answer) {
-    UniqueFd folder(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK | O_CLOEXEC));
+    const UniqueFd folder(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK | O_CLOEXEC));
     if (!folder.isValid() && errno == ENOENT) return false;
     if (!folder.isValid() && errno == ENOTDIR) {
       logUnified(LogLevel::error, "entitlement directory %s passed over: not a directory", directory.c_str());
@@ -129,19 +145,10 @@ class EntitlementFiles::Task final : public SecurityTask {
                  directory.c_str());
       return false;
     }
-    const Directory listing(::fdopendir(folder.get()));
-    if (listing == nullptr) return giveUpOn(directory, answer);
-    const int fd = folder.release();  // the listing's now
-    std::vector<std::string> names;
-    errno = 0;
-    while (const dirent* const found = ::readdir(listing.get())) {
-      const std::string_view file = found->d_name;
-      if (file.ends_with(kSuffix) && !file.starts_with('.')) names.emplace_back(file);
-    }
-    if (errno != 0) return giveUpOn(directory, answer);
-    std::sort(names.begin(), names.end());
-    return std::any_of(names.begin(), names.end(), [&](const std::string& file) {
-      return lookInFile(fd, file, directory + '/' + file, name, answer);
+    const auto names = entitlementFilesIn(folder.get());
+    if (!names) return giveUpOn(directory, answer);
+    return std::any_of(names->begin(), names->end(), [&](const std::string& file) {
+      return lookInFile(folder.get(), file, directory + '/' + file, name, answer);
     });
   }
 

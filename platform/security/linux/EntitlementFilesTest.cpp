@@ -21,7 +21,7 @@
 #include <thread>
 
 #include "platform/accounts/fakes/FakeAccountDirectory.h"
-#include "platform/base/ProcessStartTime.h"
+#include "platform/base/ProcessFacts.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/plist/PropertyListCodec.h"

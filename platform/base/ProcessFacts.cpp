@@ -1,0 +1,61 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/base/ProcessFacts.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <array>
+#include <charconv>
+#include <cstdio>
+
+#include "platform/base/UniqueFd.h"
+
+namespace brenvik {
+namespace {
+
+// The number that a text begins with.
+template <typename Number>
+bool startsWith(std::string_view text, Number* number) noexcept {
+  return std::from_chars(text.data(), text.data() + text.size(), *number).ec == std::errc();
+}
+
+}  // namespace
+
+std::optional<ProcessFacts> parseProcessStat(std::string_view text) noexcept {
+  // The program's name, field 2, is in brackets, is the process's own choice and may hold brackets and
+  // blanks: count from its end.
+  const std::size_t nameEnd = text.rfind(')');
+  if (nameEnd == std::string_view::npos) return std::nullopt;
+  std::string_view rest = text.substr(nameEnd + 1);
+  ProcessFacts facts;
+  std::uint64_t ticks = 0;
+  for (int field = 3; field <= 22; ++field) {
+    const std::size_t blank = rest.find(' ');
+    if (blank == std::string_view::npos) return std::nullopt;
+    rest.remove_prefix(blank + 1);
+    if (field == 3 && !rest.empty()) facts.state = rest.front();
+    if (field == 6 && !startsWith(rest, &facts.session)) return std::nullopt;
+    if (field == 22 && !startsWith(rest, &ticks)) return std::nullopt;
+  }
+  facts.startTime = static_cast<std::uint32_t>(ticks);
+  return facts;
+}
+
+std::optional<ProcessFacts> processFacts(pid_t pid) noexcept {
+  std::array<char, 32> path;
+  std::snprintf(path.data(), path.size(), "/proc/%d/stat", static_cast<int>(pid));
+  const UniqueFd file(::open(path.data(), O_RDONLY | O_CLOEXEC));
+  if (!file.isValid()) return std::nullopt;
+  std::array<char, 1024> text;
+  const ssize_t size = ::read(file.get(), text.data(), text.size());
+  if (size <= 0) return std::nullopt;
+  return parseProcessStat({text.data(), static_cast<std::size_t>(size)});
+}
+
+std::optional<std::uint32_t> processStartTime(pid_t pid) noexcept {
+  const auto facts = processFacts(pid);
+  return facts ? std::optional(facts->startTime) : std::nullopt;
+}
+
+}  // namespace brenvik
