@@ -61,7 +61,8 @@ if(BRENVIK_FUZZ)
 endif()
 if(NOT BRENVIK_SANITIZE AND NOT BRENVIK_FUZZ AND CMAKE_BUILD_TYPE STREQUAL "Release")
   add_compile_definitions(_FORTIFY_SOURCE=2)
-  add_link_options(-Wl,-z,relro,-z,now -Wl,--as-needed -Wl,--gc-sections)
+  # Packed relocations: fewer pages to read at each start.
+  add_link_options(-Wl,-z,relro,-z,now -Wl,-z,pack-relative-relocs -Wl,--as-needed -Wl,--gc-sections)
   add_compile_options(-ffunction-sections -fdata-sections)
 endif()
 

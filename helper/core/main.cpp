@@ -6,10 +6,15 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <exception>
+#include <functional>
+#include <memory>
+#include <new>
 #include <string>
+#include <utility>
 
 #include "helper/carrier/CarrierOperations.h"
 #include "helper/carrier/FileSystemManager.h"
@@ -49,9 +54,16 @@ constexpr rlim_t kDescriptors = 8192;
 
 void prepareProcess() noexcept {
   rlimit descriptors{};
-  if (::getrlimit(RLIMIT_NOFILE, &descriptors) == 0 && descriptors.rlim_cur < kDescriptors) {
-    descriptors.rlim_cur = std::min(kDescriptors, descriptors.rlim_max);
-    (void)::setrlimit(RLIMIT_NOFILE, &descriptors);
+  if (::getrlimit(RLIMIT_NOFILE, &descriptors) == 0) {
+    // Up to what is wanted, and down from the hard limit by what the queues may need beyond.
+    constexpr rlim_t kReserved = SystemQueues::kReservedDescriptors;
+    const rlim_t most =
+        descriptors.rlim_max > 2 * kReserved ? descriptors.rlim_max - kReserved : descriptors.rlim_max;
+    const rlim_t wanted = std::min(std::max(kDescriptors, descriptors.rlim_cur), most);
+    if (wanted != descriptors.rlim_cur) {
+      descriptors.rlim_cur = wanted;
+      (void)::setrlimit(RLIMIT_NOFILE, &descriptors);
+    }
   }
   // A reader of standard error that went away must not end the process, nor a file that reaches the size
   // limit: both are errors of the call that met them.
@@ -59,6 +71,120 @@ void prepareProcess() noexcept {
   (void)std::signal(SIGXFSZ, SIG_IGN);
   (void)::umask(022);
 }
+
+// What serves the requests, and the platform below it that only requests need.
+class Areas {
+ public:
+  Areas(SystemQueues& queues, SystemRegions& regions, PasswordDatabase& accounts)
+      : queues_(queues), regions_(regions), mobile_(MobileUser::processWide(accounts)) {
+    LASDUpdater::shared()->configure({.queues = queues_,
+                                      .web = web_.webClient(),
+                                      .gunzip = web_.gunzip(),
+                                      .preferences = preferences_,
+                                      .messagePorts = messagePorts_});
+    CellularHeartbeat::shared().configure({.queues = queues_, .network = echoNetwork_});
+  }
+  Areas(const Areas&) = delete;
+  Areas& operator=(const Areas&) = delete;
+
+  const RequestTable& requests() const noexcept { return requests_; }
+
+  // Ends the work of other threads.
+  void shutDown() noexcept {
+    // The first lets a transfer under way end, for which a check would wait.
+    web_.shutDown();
+    LASDUpdater::shared()->shutDown();
+    CellularHeartbeat::shared().shutDown();
+  }
+
+ private:
+  std::string home() const {
+    const char* const directory = mobile_.homeDirectory();
+    return directory != nullptr ? directory : "";
+  }
+  MobileAccount account() const { return {mobile_.homeDirectory(), mobile_.uid(), mobile_.gid()}; }
+
+  SystemQueues& queues_;
+  SystemRegions& regions_;
+  MobileUser& mobile_;
+
+  FilePreferences preferences_;
+  LinuxFileManager files_;
+  PreferenceTransfer preferenceTransfer_{preferences_, regions_, [this](const char* path) {
+                                           return FileSystemManager(files_).readDictionary(path);
+                                         }};
+  PathPolicy policy_{[this] { return account(); }};
+  CarrierOperations carrier_{FileSystemManager::factory(files_), ZipArchiveCopier::factory(), policy_,
+                             preferences_, [this] { return account(); }};
+  ModemManagerLogs radio_{queues_};
+  RadioLogging radioLogging_{radio_};
+
+  CatalogueLabeler labeler_;
+  LabelRoutines labels_{labeler_, regions_};
+  SqliteContacts contacts_{[this] { return home(); }};
+  ChannelRemap channelRemap_{contacts_};
+
+  LoadedWebModule web_{queues_};
+  ChannelMessagePorts messagePorts_{BRENVIK_BOOTSTRAP_DIRECTORY};
+  SystemEchoNetwork echoNetwork_;
+
+  SqliteVoicemailStore voicemailStore_{[this] {
+    return SqliteVoicemailStore::Account{home(), mobile_.uid(), mobile_.gid()};
+  }};
+  DynamicVisualVoicemail visualVoicemail_{BRENVIK_VISUAL_VOICEMAIL_LIBRARY, BRENVIK_VISUAL_VOICEMAIL_SYMBOL};
+  VoicemailOperations voicemail_{voicemailStore_, visualVoicemail_};
+
+  SystemGeoService geoService_{queues_,
+                               web_.webClient(),
+                               {.geocoderUrl = BRENVIK_GEOCODER_URL,
+                                .gazetteer = BRENVIK_GAZETTEER,
+                                .stunServer = BRENVIK_STUN_SERVER,
+                                .countryFiles = {.configuration = BRENVIK_COUNTRY_CONFIGURATION}}};
+  ChannelTelephonyDaemon telephonyDaemon_{BRENVIK_BOOTSTRAP_DIRECTORY};
+  LocationRoutines location_{queues_, geoService_, telephonyDaemon_, GeoRequestState::shared()};
+
+  HelperRoutines routines_{{.preferences = preferenceTransfer_,
+                            .carrier = carrier_,
+                            .voicemail = voicemail_,
+                            .location = location_,
+                            .radioLogging = radioLogging_,
+                            .labels = labels_,
+                            .channelRemap = channelRemap_,
+                            .lasd = *LASDUpdater::shared(),
+                            .heartbeat = CellularHeartbeat::shared()}};
+  const RequestTable requests_{routines_};
+};
+
+// The table of requests, whose areas are made for the first of them: whoever started the process waits for
+// its check-in, which needs none.
+class RequestsOnFirstUse final : public RoutineTable {
+ public:
+  explicit RequestsOnFirstUse(std::function<std::unique_ptr<Areas>()> make) : make_(std::move(make)) {}
+
+  Handler find(std::int32_t id) const noexcept override {
+    try {
+      if (areas_ == nullptr) areas_ = make_();
+    } catch (const std::bad_alloc&) {
+      return [](void*, const Request&, Reply& reply) {
+        reply.setStatus(kern::resourceShortage);
+        return Outcome::refused;
+      };
+    }
+    return areas_->requests().find(id);
+  }
+  void* context() const noexcept override {
+    return areas_ != nullptr ? areas_->requests().context() : nullptr;
+  }
+
+  // Ends the work of other threads, if there is any.
+  void shutDown() noexcept {
+    if (areas_ != nullptr) areas_->shutDown();
+  }
+
+ private:
+  const std::function<std::unique_ptr<Areas>()> make_;
+  mutable std::unique_ptr<Areas> areas_;  // main thread only
+};
 
 int run() {
   prepareProcess();
@@ -72,11 +198,6 @@ int run() {
   }
   SystemQueues queues(*loop);
   PasswordDatabase accounts;
-  MobileUser& mobile = MobileUser::processWide(accounts);
-  const auto mobileHome = [&mobile] {
-    const char* const home = mobile.homeDirectory();
-    return std::string(home != nullptr ? home : "");
-  };
   EntitlementFiles security(accounts);
   EntitlementCheck entitlements(security, queues);
 
@@ -86,72 +207,17 @@ int run() {
   SystemBootstrap bootstrap(ports, BRENVIK_BOOTSTRAP_DIRECTORY);
   LoadedBasebandLibrary baseband;
 
-  FilePreferences preferences;
-  LinuxFileManager files;
-  PreferenceTransfer preferenceTransfer(preferences, regions, [&files](const char* path) {
-    return FileSystemManager(files).readDictionary(path);
-  });
-  const auto mobileAccount = [&mobile] {
-    return MobileAccount{mobile.homeDirectory(), mobile.uid(), mobile.gid()};
-  };
-  PathPolicy policy(mobileAccount);
-  CarrierOperations carrier(FileSystemManager::factory(files), ZipArchiveCopier::factory(), policy,
-                            preferences, mobileAccount);
-  ModemManagerLogs radio(queues);
-  RadioLogging radioLogging(radio);
-
-  CatalogueLabeler labeler;
-  LabelRoutines labels(labeler, regions);
-  SqliteContacts contacts(mobileHome);
-  ChannelRemap channelRemap(contacts);
-
-  LoadedWebModule web(queues);
-  ChannelMessagePorts messagePorts(BRENVIK_BOOTSTRAP_DIRECTORY);
-  const auto& lasd = LASDUpdater::shared();
-  lasd->configure({.queues = queues,
-                   .web = web.webClient(),
-                   .gunzip = web.gunzip(),
-                   .preferences = preferences,
-                   .messagePorts = messagePorts});
-  SystemEchoNetwork echoNetwork;
-  CellularHeartbeat& heartbeat = CellularHeartbeat::shared();
-  heartbeat.configure({.queues = queues, .network = echoNetwork});
-
-  SqliteVoicemailStore voicemailStore([&mobile, mobileHome] {
-    return SqliteVoicemailStore::Account{mobileHome(), mobile.uid(), mobile.gid()};
-  });
-  DynamicVisualVoicemail visualVoicemail(BRENVIK_VISUAL_VOICEMAIL_LIBRARY, BRENVIK_VISUAL_VOICEMAIL_SYMBOL);
-  VoicemailOperations voicemail(voicemailStore, visualVoicemail);
-
-  SystemGeoService geoService(queues, web.webClient(),
-                              {.geocoderUrl = BRENVIK_GEOCODER_URL,
-                               .gazetteer = BRENVIK_GAZETTEER,
-                               .stunServer = BRENVIK_STUN_SERVER,
-                               .countryFiles = {.configuration = BRENVIK_COUNTRY_CONFIGURATION}});
-  ChannelTelephonyDaemon telephonyDaemon(BRENVIK_BOOTSTRAP_DIRECTORY);
-  LocationRoutines location(queues, geoService, telephonyDaemon, GeoRequestState::shared());
-
-  HelperRoutines routines({.preferences = preferenceTransfer,
-                           .carrier = carrier,
-                           .voicemail = voicemail,
-                           .location = location,
-                           .radioLogging = radioLogging,
-                           .labels = labels,
-                           .channelRemap = channelRemap,
-                           .lasd = *lasd,
-                           .heartbeat = heartbeat});
-  const RequestTable requests(routines);
-  const ServerPlatform platform{ports, bootstrap, sources, *loop,
-                                [&entitlements](const char* entitlement, const AuditToken& caller) {
-                                  return entitlements.HasEntitlement(entitlement, caller);
-                                }};
-  const auto endWork = [&] {
-    // The first lets a transfer under way end, for which a check would wait.
-    web.shutDown();
-    lasd->shutDown();
-    heartbeat.shutDown();
-  };
-  const int status = runHelper(baseband, platform, requests, endWork);
+  RequestsOnFirstUse requests([&] { return std::make_unique<Areas>(queues, regions, accounts); });
+  const ServerPlatform platform{.ports = ports,
+                                .bootstrap = bootstrap,
+                                .sources = sources,
+                                .loop = *loop,
+                                .hasEntitlement =
+                                    [&entitlements](const char* entitlement, const AuditToken& caller) {
+                                      return entitlements.HasEntitlement(entitlement, caller);
+                                    },
+                                .idlePeriod = std::chrono::milliseconds(BRENVIK_IDLE_MILLISECONDS)};
+  const int status = runHelper(baseband, platform, requests, [&requests] { requests.shutDown(); });
   setLogSink(nullptr);
   return status;
 }

@@ -16,7 +16,6 @@
 namespace brenvik {
 namespace {
 
-constexpr std::chrono::seconds kIdlePeriod{10};
 constexpr std::chrono::duration<double> kNoTimeOut{std::numeric_limits<double>::max()};
 
 using Lock = std::unique_lock<std::mutex>;
@@ -34,8 +33,9 @@ void idleTimerTick(ServerContext& server) {
 void armIdleTimer(ServerContext& server, Lock& lock) {
   if (server.idleTimer != nullptr) return;
   RunLoop& loop = server.runLoop != nullptr ? *server.runLoop : server.platform.loop;
+  const std::chrono::nanoseconds period = server.platform.idlePeriod;
   server.idleTimer = loop.addTimer(
-      kIdlePeriod, kIdlePeriod, [&server] { idleTimerTick(server); }, [&server] { StopServer(server); });
+      period, period, [&server] { idleTimerTick(server); }, [&server] { StopServer(server); });
   if (server.idleTimer != nullptr) return;
   lock.unlock();
   StopServer(server);

@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -33,6 +34,8 @@ struct ServerPlatform {
   // Whether the caller holds a boolean entitlement.
   std::function<bool(const char* entitlement, const AuditToken& caller)> hasEntitlement;
   PortServerRegistry& registry = PortServerRegistry::shared();
+  // How long the process waits before it leaves for being idle, and between the times it then asks.
+  std::chrono::nanoseconds idlePeriod = std::chrono::seconds(10);
 };
 
 class ServerContext;
