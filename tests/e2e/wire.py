@@ -173,6 +173,7 @@ class Client:
     """A checked-in client. `life` is the port whose death ends it at the helper."""
 
     def __init__(self, path=None):
+        self.life = None
         service = connect(path)
         try:
             self.life, theirs = socket.socketpair(socket.AF_UNIX, socket.SOCK_SEQPACKET)
@@ -180,7 +181,6 @@ class Client:
                 message = check_in_message()
                 reply, fds = service.exchange(message, [theirs.fileno()])
             if len(reply) == 36:
-                self.life.close()
                 raise Status(check_status(message, reply))
             bits, size, remote, local, voucher, message_id, count = struct.unpack_from("<IIIIIiI", reply)
             assert (bits, size, remote, local, voucher, message_id, count) == (
@@ -189,6 +189,10 @@ class Client:
             assert (name, pad1, pad2, disposition, kind) == (0, 0, 0, 19, 0), reply
             assert len(reply) == 40 and len(fds) == 1
             self.channel = Channel(socket.socket(fileno=fds[0]))
+        except BaseException:
+            if self.life is not None:
+                self.life.close()
+            raise
         finally:
             service.close()
 

@@ -1,0 +1,100 @@
+# SPDX-License-Identifier: Apache-2.0
+# SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+"""What a request costs the real process: system calls and memory from the heap."""
+import pathlib
+import re
+import signal
+import struct
+import subprocess
+import unittest
+
+import wire
+from harness import BUILD, Daemon, HelperTest, eventually, main
+
+COUNTER = BUILD / "libbrenvik-count-allocations.so"
+COUNT = pathlib.Path("/tmp/allocations")
+CALLS = 50
+
+# A request and the size of its reply. The routines themselves touch neither disk nor heap: a token that is no text,
+# and a question whose answer is known after the first time.
+IN_LINE = {
+    "288 bytes in, 36 out": (wire.simple("SetVoicemailToken", wire.field(b"\xff", 256)), 36),
+    "24 bytes in, 40 out": (wire.simple("IsVoicemailServiceSubscribed"), 40),
+    "refused for its size": (wire.simple("SetVoicemailToken", wire.field(b"", 255)), 36),
+    "of unknown id": (wire.header(1, 24), 36),
+}
+
+
+class Costs(HelperTest):
+    def setUp(self):
+        super().setUp()
+        self.caller = self.client()
+
+    def call(self, message, size):
+        reply, fds = self.caller.channel.exchange(message)
+        self.assertEqual((len(reply), fds), (size, []))
+
+    def calls_traced(self, work):
+        """The system calls of the process while work() runs, from one wait to the next."""
+        output = pathlib.Path("/tmp/trace")
+        tracer = subprocess.Popen(["strace", "-f", "-p", str(self.daemon.pid), "-o", str(output)],
+                                  stderr=subprocess.PIPE)
+        self.assertIn(b"attached", tracer.stderr.readline())
+        work()
+        # The reply is seen before the tracer has written what comes after it.
+        eventually(lambda: re.search(rb"epoll_wait\([^\n]*\Z", output.read_bytes().rstrip()), what="the next wait")
+        tracer.send_signal(signal.SIGINT)
+        tracer.communicate(timeout=10)
+        return re.findall(r"^\d+ +(\w+)\(", output.read_text(), re.M)
+
+    def test_an_in_line_request_costs_three_system_calls(self):
+        for name, (message, size) in IN_LINE.items():
+            with self.subTest(name):
+                self.call(message, size)
+
+                def work():
+                    for _ in range(CALLS):
+                        self.call(message, size)
+                calls = self.calls_traced(work)
+                # It was waiting when the tracer came, and it waits now.
+                self.assertEqual(calls[:-1], ["epoll_wait", "recvmsg", "sendto"] * CALLS)
+                self.assertEqual(calls[-1], "epoll_wait")
+
+    def test_a_request_that_is_not_answered_costs_no_wake_up_of_its_own_while_more_wait(self):
+        message = bytearray(IN_LINE["288 bytes in, 36 out"][0])
+        struct.pack_into("<I", message, 8, 0)
+
+        def work():
+            self.daemon.process.send_signal(signal.SIGSTOP)
+            for _ in range(8):
+                self.caller.channel.send(bytes(message))
+            self.daemon.process.send_signal(signal.SIGCONT)
+            self.call(*IN_LINE["of unknown id"])
+        calls = self.calls_traced(work)
+        self.assertEqual(calls.count("recvmsg"), 9)
+        self.assertLessEqual(calls.count("epoll_wait"), 5)
+
+    @unittest.skipUnless(COUNTER.exists(), "not in a build with sanitizers, which count themselves")
+    def test_an_in_line_request_takes_nothing_from_the_heap(self):
+        self.daemon.stop()
+        COUNT.write_bytes(bytes(8))
+        self.daemon = Daemon(environment={"LD_PRELOAD": str(COUNTER), "BRENVIK_ALLOCATION_COUNT": str(COUNT)})
+        self.caller = self.client()
+
+        def count():
+            return struct.unpack("<Q", COUNT.read_bytes())[0]
+        self.assertGreater(count(), 0, "the counter counts")
+        for name, (message, size) in IN_LINE.items():
+            with self.subTest(name):
+                self.call(message, size)
+                before = count()
+                for _ in range(CALLS):
+                    self.call(message, size)
+                self.assertEqual(count(), before)
+        before = count()
+        self.caller.copy_preference("com.example.costs", "key")
+        self.assertGreater(count(), before, "a routine that takes memory is noticed")
+
+
+if __name__ == "__main__":
+    main()
