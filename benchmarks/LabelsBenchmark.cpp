@@ -3,32 +3,17 @@
 //
 // Whole requests for the six labels in one language, over real channels to another process, beside an empty
 // request over the same channel; and the routines alone. The serving process has the real transport and label
-// routines behind a table of its own, and writes its log to /dev/null unless a journal listens.
-#include <fcntl.h>
-#include <signal.h>
-#include <sys/prctl.h>
-#include <sys/socket.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <array>
-#include <chrono>
-#include <cstdlib>
-#include <cstring>
-#include <limits>
-#include <memory>
+// routines behind a table of its own.
 #include <string>
 #include <vector>
 
 #include "Ratios.h"
+#include "TableServer.h"
 #include "helper/labels/LabelRoutines.h"
 #include "interface/Messages.h"
 #include "platform/ipc/fakes/HeapRegions.h"
-#include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/labeler/linux/CatalogueLabeler.h"
-#include "platform/log/linux/SystemLog.h"
 #include "platform/plist/PropertyListCodec.h"
-#include "platform/runloop/linux/SystemQueues.h"
 
 namespace brenvik {
 namespace {
@@ -64,76 +49,18 @@ class BenchmarkTable final : public RoutineTable {
       reply.setStatus(code);
       return Outcome::refused;
     }
-    auto& result = reply.as<OutOfLineReply>();
-    result.header.bits = kReplyDisposition | kComplexBit;
-    result.header.size = sizeof result;
-    result.descriptorCount = 1;
-    result.payload = {reinterpret_cast<std::uint64_t>(payload.address),
-                      1,
-                      kVirtualCopy,
-                      0,
-                      kOutOfLineDescriptorType,
-                      payload.length};
-    result.ndr = kNdrRecord;
-    result.byteCount = payload.length;
+    answerWithRegion(reply, payload.address, payload.length);
     return Outcome::accepted;
   }
   LabelRoutines& routines_;
 };
 
-// A process that serves the table until this one goes.
-class Server {
- public:
-  Server() {
-    PortName port = kNullPort;
-    if (ports_.allocateReceiveRight(&port) != kern::success ||
-        ports_.insertSendRight(port) != kern::success) {
-      std::abort();
-    }
-    client_ = UniqueFd(::fcntl(ports_.sendEnd(port)->get(), F_DUPFD_CLOEXEC, 0));
-    child_ = ::fork();
-    if (child_ == 0) serve(port);
-    (void)ports_.dropReceiveRight(port);
-  }
-  ~Server() {
-    ::kill(child_, SIGKILL);
-    ::waitpid(child_, nullptr, 0);
-  }
-  // Sends a request and waits for its answer; its length in bytes.
-  std::size_t exchange(const std::string& request) {
-    if (::send(client_.get(), request.data(), request.size(), MSG_NOSIGNAL) < 0) std::abort();
-    const ssize_t size = ::recv(client_.get(), reply_.data(), reply_.size(), 0);
-    if (size < 0) std::abort();
-    return static_cast<std::size_t>(size);
-  }
-
- private:
-  [[noreturn]] void serve(PortName port) {
-    ::prctl(PR_SET_PDEATHSIG, SIGKILL);
-    client_.reset();
-    ::dup2(::open("/dev/null", O_WRONLY | O_CLOEXEC), STDERR_FILENO);
-    SystemLog log("LabelsBenchmark");
-    setLogSink(&log);
-    const auto loop = SystemRunLoop::make();
-    SystemRegions regions;
-    SystemPortSources sources(ports_, regions);
+TableServer& server() {
+  static TableServer instance([](const TableServer::Surroundings& here, const auto& serve) {
     CatalogueLabeler labeler;
-    LabelRoutines routines(labeler, regions);
-    BenchmarkTable table(routines);
-    const auto source = sources.makeRoutineSource(port, table, WantTrailer::no);
-    if (loop == nullptr || source == nullptr || !source->addTo(*loop)) ::_exit(1);
-    (void)loop->run(std::chrono::duration<double>(std::numeric_limits<double>::max()), ReturnAfterSource::no);
-    ::_exit(0);
-  }
-
-  SystemPortSpace ports_;
-  UniqueFd client_;
-  pid_t child_ = -1;
-  std::vector<char> reply_ = std::vector<char>(kLargestDatagram);
-};
-
-Server& server() {
-  static Server instance;
+    LabelRoutines routines(labeler, here.regions);
+    serve(BenchmarkTable(routines));
+  });
   return instance;
 }
 
@@ -188,9 +115,9 @@ std::string labelsRequest(std::int32_t id, const std::string& labels) {
 }
 
 void roundTrips(benchmark::State& state, const std::string& request, std::size_t shortestAnswer) {
-  Server& peer = server();
-  if (peer.exchange(request) < shortestAnswer) return state.SkipWithError("refused");
-  for (auto _ : state) benchmark::DoNotOptimize(peer.exchange(request));
+  TableServer& peer = server();
+  if (peer.exchange(request.data(), request.size()) < shortestAnswer) return state.SkipWithError("refused");
+  for (auto _ : state) benchmark::DoNotOptimize(peer.exchange(request.data(), request.size()));
 }
 
 void emptyRoundTrip(benchmark::State& state) { roundTrips(state, emptyRequest(), sizeof(StatusReply)); }

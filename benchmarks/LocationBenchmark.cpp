@@ -9,40 +9,29 @@
 //
 // usage: LocationBenchmark GAZETTEER.db [PAIRS [LOOK-UPS]]
 #include <benchmark/benchmark.h>
-#include <fcntl.h>
-#include <signal.h>
-#include <sys/prctl.h>
-#include <sys/socket.h>
-#include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <array>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
-#include <functional>
-#include <limits>
 #include <memory>
 #include <random>
 #include <string>
 #include <vector>
 
+#include "Paired.h"
+#include "TableServer.h"
 #include "helper/location/GeoRequestState.h"
 #include "helper/location/LocationRoutines.h"
 #include "interface/Messages.h"
-#include "platform/base/UniqueFd.h"
 #include "platform/geo/linux/Gazetteer.h"
-#include "platform/ipc/linux/SystemPortSources.h"
-#include "platform/log/linux/SystemLog.h"
-#include "platform/runloop/linux/SystemQueues.h"
 
 namespace brenvik {
 namespace {
 
 using Clock = std::chrono::steady_clock;
-using Times = std::vector<double>;  // microseconds
 
 constexpr std::int32_t kEmpty = 1;
 constexpr std::int32_t kWanIp = 2;
@@ -124,70 +113,16 @@ class BenchmarkTable final : public RoutineTable {
   LocationRoutines& routines_;
 };
 
-// A process that serves the table until this one goes.
-class Server {
- public:
-  Server() {
-    PortName port = kNullPort;
-    if (ports_.allocateReceiveRight(&port) != kern::success ||
-        ports_.insertSendRight(port) != kern::success) {
-      std::abort();
-    }
-    client_ = UniqueFd(::fcntl(ports_.sendEnd(port)->get(), F_DUPFD_CLOEXEC, 0));
-    child_ = ::fork();
-    if (child_ == 0) serve(port);
-    (void)ports_.dropReceiveRight(port);
+// Sends the request and waits for its status; microseconds.
+template <typename Message>
+double exchange(TableServer& server, const Message& request) {
+  const auto before = Clock::now();
+  if (server.exchange(&request, sizeof request) != sizeof(StatusReply) ||
+      server.reply<StatusReply>().returnCode != kern::success) {
+    std::fprintf(stderr, "the server refuses\n");
+    std::exit(2);
   }
-  Server(const Server&) = delete;
-  Server& operator=(const Server&) = delete;
-  ~Server() {
-    ::kill(child_, SIGKILL);
-    ::waitpid(child_, nullptr, 0);
-  }
-  // Sends the request and waits for its status; microseconds.
-  template <typename Message>
-  double exchange(const Message& request) {
-    const auto before = Clock::now();
-    StatusReply reply{};
-    if (::send(client_.get(), &request, sizeof request, MSG_NOSIGNAL) < 0 ||
-        ::recv(client_.get(), &reply, sizeof reply, 0) != sizeof reply || reply.returnCode != kern::success) {
-      std::fprintf(stderr, "the server refuses\n");
-      std::exit(2);
-    }
-    return std::chrono::duration<double, std::micro>(Clock::now() - before).count();
-  }
-
- private:
-  [[noreturn]] void serve(PortName port) {
-    ::prctl(PR_SET_PDEATHSIG, SIGKILL);
-    client_.reset();
-    ::dup2(::open("/dev/null", O_WRONLY | O_CLOEXEC), STDERR_FILENO);
-    SystemLog log("LocationBenchmark");
-    setLogSink(&log);
-    const auto loop = SystemRunLoop::make();
-    SystemQueues queues(*loop);
-    SystemRegions regions;
-    SystemPortSources sources(ports_, regions);
-    GeoServiceNeverAnswers geo;
-    NoTelephonyDaemon telephony;
-    LocationRoutines routines(queues, geo, telephony, GeoRequestState::shared());
-    BenchmarkTable table(routines);
-    const auto source = sources.makeRoutineSource(port, table, WantTrailer::no);
-    if (source == nullptr || !source->addTo(*loop)) ::_exit(1);
-    (void)loop->run(std::chrono::duration<double>(std::numeric_limits<double>::max()), ReturnAfterSource::no);
-    ::_exit(0);
-  }
-
-  SystemPortSpace ports_;
-  UniqueFd client_;
-  pid_t child_ = -1;
-};
-
-double quantile(Times& times, double share) {
-  const auto at =
-      std::min(times.size() - 1, static_cast<std::size_t>(static_cast<double>(times.size()) * share));
-  std::nth_element(times.begin(), times.begin() + static_cast<std::ptrdiff_t>(at), times.end());
-  return times[at];
+  return std::chrono::duration<double, std::micro>(Clock::now() - before).count();
 }
 
 MessageHeader headerOf(std::int32_t id, std::size_t size) {
@@ -195,45 +130,34 @@ MessageHeader headerOf(std::int32_t id, std::size_t size) {
 }
 
 bool compareRequests(int pairs) {
-  Server server;
+  TableServer server([](const TableServer::Surroundings& here, const auto& serve) {
+    SystemQueues queues(here.loop);
+    GeoServiceNeverAnswers geo;
+    NoTelephonyDaemon telephony;
+    LocationRoutines routines(queues, geo, telephony, GeoRequestState::shared());
+    serve(BenchmarkTable(routines));
+  });
   const CoordinateRequest civicInfo{headerOf(kCivicInfo, sizeof(CoordinateRequest)), kNdrRecord, 48.8584,
                                     2.2945};
-  struct Measured {
-    const char* name;
-    std::function<double()> exchange;
-    Times times;
-  };
-  const auto plain = [&](std::int32_t id) {
+  // Each after the same pause, so that what a request set going has come to rest.
+  constexpr useconds_t kRest = 300;
+  const auto plain = [&server](std::int32_t id) {
     return [&server, request = EmptyRequest{headerOf(id, sizeof(EmptyRequest))}] {
-      return server.exchange(request);
+      ::usleep(kRest);
+      return exchange(server, request);
     };
   };
-  std::array measured{Measured{"empty request", plain(kEmpty), {}},
-                      Measured{"empty, one unified line", plain(kOneUnifiedLine), {}},
-                      Measured{"public address asked for", plain(kWanIp), {}},
-                      Measured{"empty, one BSD line", plain(kOneBsdLine), {}},
-                      Measured{"civic address asked for", [&] { return server.exchange(civicInfo); }, {}}};
-  // In turns, and each after the same pause, so that what a request set going has come to rest.
-  for (int i = 0; i < pairs; ++i) {
-    for (Measured& each : measured) {
-      ::usleep(300);
-      each.times.push_back(each.exchange());
-    }
-  }
-  std::array<double, measured.size()> medians;
-  for (std::size_t i = 0; i < measured.size(); ++i) {
-    medians[i] = quantile(measured[i].times, 0.5);
-    std::printf("%-32s %8.1f us\n", measured[i].name, medians[i]);
-  }
-  bool good = true;
-  for (const std::size_t i : {2U, 4U}) {
-    const double ratio = medians[i] / medians[i - 1];
-    const bool within = ratio <= kMostOfAnEmptyRequest;
-    std::printf("%-32s ratio %.3f, at most %.2f  %s\n", measured[i].name, ratio, kMostOfAnEmptyRequest,
-                within ? "ok" : "ABOVE");
-    good = good && within;
-  }
-  return good;
+  const std::vector<Contestant> contestants{{"empty request", plain(kEmpty)},
+                                            {"empty, one unified line", plain(kOneUnifiedLine)},
+                                            {"public address asked for", plain(kWanIp)},
+                                            {"empty, one BSD line", plain(kOneBsdLine)},
+                                            {"civic address asked for", [&] {
+                                               ::usleep(kRest);
+                                               return exchange(server, civicInfo);
+                                             }}};
+  constexpr int kTurn = 100;
+  return comparePaired({.rounds = std::max(1, pairs / kTurn), .unmeasured = 5, .measured = kTurn},
+                       contestants, {{2, 1, kMostOfAnEmptyRequest}, {4, 3, kMostOfAnEmptyRequest}});
 }
 
 bool measureLookUps(const char* path, int count) {
