@@ -25,6 +25,7 @@ IN_LINE = {
 }
 
 
+@unittest.skipUnless(COUNTER.exists(), "a sanitizer has costs of its own")
 class Costs(HelperTest):
     def setUp(self):
         super().setUp()
@@ -56,9 +57,8 @@ class Costs(HelperTest):
                     for _ in range(CALLS):
                         self.call(message, size)
                 calls = self.calls_traced(work)
-                # It was waiting when the tracer came, and it waits now.
-                self.assertEqual(calls[:-1], ["epoll_wait", "recvmsg", "sendto"] * CALLS)
-                self.assertEqual(calls[-1], "epoll_wait")
+                # It was waiting already when the tracer came, which the tracer may or may not have seen.
+                self.assertEqual(calls[calls.index("recvmsg"):], ["recvmsg", "sendto", "epoll_wait"] * CALLS)
 
     def test_a_request_that_is_not_answered_costs_no_wake_up_of_its_own_while_more_wait(self):
         message = bytearray(IN_LINE["288 bytes in, 36 out"][0])
@@ -74,7 +74,6 @@ class Costs(HelperTest):
         self.assertEqual(calls.count("recvmsg"), 9)
         self.assertLessEqual(calls.count("epoll_wait"), 5)
 
-    @unittest.skipUnless(COUNTER.exists(), "not in a build with sanitizers, which count themselves")
     def test_an_in_line_request_takes_nothing_from_the_heap(self):
         self.daemon.stop()
         COUNT.write_bytes(bytes(8))

@@ -100,6 +100,9 @@ class HostileClients(HelperTest):
 
     def test_a_client_that_is_stopped_or_killed_in_the_middle_is_not_noticed(self):
         self.assert_served()
+        # The first caller to exit leaves the queue behind on which exits are handled.
+        self.assertEqual(as_account("root", lambda: wire.Client().close() or 0), 0)
+        eventually(lambda: "global" in self.daemon.threads(), what="the exit being handled")
         before = self.daemon.descriptors()
         for what in (signal.SIGSTOP, signal.SIGKILL):
             pid = os.fork()

@@ -68,10 +68,11 @@ class IncomingMessage {
   std::array<UniqueFd, kMostRights> fds_;
   std::array<Mapping, kMostRights> mappings_;
   std::array<PortName, kMostRights> names_;
+  // The control data first: it shares the pages of the counts above.
   struct Storage {
-    alignas(16) std::array<std::byte, kLargestDatagram> bytes;
     alignas(
         cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * kMostRights) + CMSG_SPACE(sizeof(ucred))> control;
+    alignas(16) std::array<std::byte, kLargestDatagram> bytes;
   };
   Storage storage_;
 };

@@ -29,12 +29,12 @@ namespace {
 constexpr int kLockTries = 100;
 constexpr std::chrono::milliseconds kLockPause{10};
 
-// Whether somebody listens behind a socket file.
+// Whether somebody listens behind a socket file. Only a refusal says no: a full backlog, another kind of
+// socket and a probe that cannot be made at all leave the file where it is.
 bool isAlive(const sockaddr_un& address) noexcept {
   const UniqueFd probe(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
   if (::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0) return true;
-  // EAGAIN: its backlog is full. EPROTOTYPE: another kind of socket, and a live one.
-  return errno == EAGAIN || errno == EPROTOTYPE;
+  return errno != ECONNREFUSED && errno != ENOENT;
 }
 
 bool isListeningPort(int fd) noexcept {

@@ -8,6 +8,7 @@
 #include <linux/seccomp.h>
 #include <signal.h>
 #include <sys/epoll.h>
+#include <sys/eventfd.h>
 #include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
@@ -98,6 +99,54 @@ TEST_F(SystemQueuesTest, ADescriptorThatIsReadyIsServedBeforeATimerThatIsDue) {
   ASSERT_EQ(::write(write.get(), "x", 1), 1);
   runUntil([&] { return order.size() == 2; });
   EXPECT_EQ(order, "dt");
+}
+
+TEST_F(SystemQueuesTest, DescriptorsThatAreAlwaysReadyTakeTurns) {
+  const UniqueFd first(::eventfd(1, EFD_CLOEXEC));
+  const UniqueFd second(::eventfd(1, EFD_CLOEXEC));
+  const UniqueFd third(::eventfd(1, EFD_CLOEXEC));
+  std::array<int, 3> served{};
+  const auto a = loop->addDescriptor(first.get(), EPOLLIN, [&](std::uint32_t) { ++served[0]; });
+  const auto b = loop->addDescriptor(second.get(), EPOLLIN, [&](std::uint32_t) { ++served[1]; });
+  const auto c = loop->addDescriptor(third.get(), EPOLLIN, [&](std::uint32_t) { ++served[2]; });
+  for (int i = 0; i < 30; ++i) (void)loop->run(0s, ReturnAfterSource::yes);
+  EXPECT_EQ(served, (std::array{10, 10, 10}));
+}
+
+TEST_F(SystemQueuesTest, AHandlerMayEndItsOwnWatchingAndThatOfAnotherThatIsReady) {
+  const UniqueFd first(::eventfd(1, EFD_CLOEXEC));
+  const UniqueFd second(::eventfd(1, EFD_CLOEXEC));
+  int served = 0;
+  std::unique_ptr<DescriptorSource> a;
+  std::unique_ptr<DescriptorSource> b;
+  const auto endBoth = [&](std::uint32_t) {
+    ++served;
+    a.reset();
+    b.reset();
+    EXPECT_EQ(loop->run(0s, ReturnAfterSource::no), RunResult::timedOut) << "nothing is watched any more";
+  };
+  a = loop->addDescriptor(first.get(), EPOLLIN, endBoth);
+  b = loop->addDescriptor(second.get(), EPOLLIN, endBoth);
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::handledSource);
+  EXPECT_EQ(served, 1);
+}
+
+TEST_F(SystemQueuesTest, ATimerThatIsMadeOrCancelledWhileAnotherRunsDownIsHeeded) {
+  const UniqueFd ready(::eventfd(1, EFD_CLOEXEC));
+  std::string order;
+  const auto late = loop->addTimer(40ms, 0s, [&] { order += 'l'; }, {});
+  std::unique_ptr<LoopSource> early;
+  std::unique_ptr<LoopSource> never = loop->addTimer(5ms, 0s, [&] { order += 'n'; }, {});
+  std::unique_ptr<DescriptorSource> source;
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::no), RunResult::timedOut);  // both run down now
+  source = loop->addDescriptor(ready.get(), EPOLLIN, [&](std::uint32_t) {
+    order += 'd';
+    never.reset();
+    early = loop->addTimer(1ms, 0s, [&] { order += 'e'; }, {});
+    source.reset();
+  });
+  runUntil([&] { return order.size() == 3; });
+  EXPECT_EQ(order, "del");
 }
 
 TEST_F(SystemQueuesTest, TimerOfAnotherThreadFiresOnTheLoopAndCanBeCancelledThere) {
