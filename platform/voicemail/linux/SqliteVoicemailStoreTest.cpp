@@ -3,6 +3,7 @@
 #include "platform/voicemail/linux/SqliteVoicemailStore.h"
 
 #include <gtest/gtest.h>
+#include <sched.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -10,7 +11,9 @@
 
 #include <chrono>
 #include <memory>
+#include <optional>
 #include <string>
+#include <vector>
 
 #include "platform/files/fakes/ChildProcesses.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
@@ -264,6 +267,106 @@ TEST_F(SqliteVoicemailStoreTest, KilledAtAnyMomentItOpensAndHoldsEveryTokenWhose
     last = answered + 1;
   }
   EXPECT_GT(answered, 0);
+}
+
+// The store's changes in a fixed order, and what it holds after the first `count` of them.
+class Changes {
+ public:
+  static void apply(VoicemailStore& store, int number) {
+    const std::string text = std::to_string(number);
+    if (number % 31 == 30) {
+      store.removeAllRecords();
+    } else if (number % 7 == 6) {
+      store.setToken(nullptr);
+    } else if (number % 2 == 0) {
+      store.setToken(&text);
+    } else {
+      store.setTokenForKey("key" + std::to_string(number % 9), text);
+    }
+  }
+  static std::vector<std::optional<std::string>> after(int count) {
+    InMemoryVoicemailStore model;
+    for (int number = std::max(0, count - 200); number < count; ++number) apply(model, number);
+    return contentOf(model);
+  }
+  static std::vector<std::optional<std::string>> contentOf(VoicemailStore& store) {
+    std::vector<std::optional<std::string>> content{store.copyToken()};
+    for (int i = 0; i < 9; ++i) content.push_back(store.copyTokenForKey("key" + std::to_string(i)));
+    return content;
+  }
+};
+
+TEST_F(SqliteVoicemailStoreTest, KilledAmidSetsClearsAndResetsItHoldsWhatWasAnsweredAndAtMostOneChangeMore) {
+  // In memory where the system has such a place: what a kill leaves is the same, and there is time for more.
+  TemporaryDirectory memory(::access("/dev/shm", W_OK) == 0 ? std::filesystem::path("/dev/shm")
+                                                            : std::filesystem::temp_directory_path());
+  SqliteVoicemailStore fast(memory.path(), ::getuid(), ::getgid());
+  int done = 0;
+  for (int round = 0; round < 200; ++round) {
+    int channel[2];
+    ASSERT_EQ(::pipe(channel), 0);
+    const pid_t child = ::fork();
+    if (child == 0) {
+      killThisProcessAfter(std::chrono::microseconds(300 + round * 23));
+      for (int number = done;; ++number) {
+        Changes::apply(fast, number);
+        if (::write(channel[1], "x", 1) != 1) ::_exit(1);
+      }
+    }
+    ::close(channel[1]);
+    char answered = 0;
+    while (::read(channel[0], &answered, 1) == 1) ++done;
+    ::close(channel[0]);
+    ::waitpid(child, nullptr, 0);
+    const auto content = Changes::contentOf(fast);
+    if (content != Changes::after(done)) {
+      // The last change was made, and its answer cut off.
+      ++done;
+      ASSERT_EQ(content, Changes::after(done)) << "round " << round;
+    }
+  }
+  EXPECT_GT(done, 200);
+}
+
+TEST_F(SqliteVoicemailStoreTest, WhereItMayNotWriteTheOldTokenStaysAndTheFailureIsLogged) {
+  if (::geteuid() != 0) GTEST_SKIP() << "becomes another user";
+  store.setToken(&token);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    ASSERT_EQ(::chmod(home.path().c_str(), 0755), 0);
+    if (::setresgid(4712, 4712, 4712) != 0 || ::setresuid(4711, 4711, 4711) != 0) ::_exit(9);
+    RecordingLog log;
+    const std::string other = "other";
+    store.setToken(&other);
+    store.setTokenForKey("key", other);
+    store.setToken(nullptr);
+    store.removeAllRecords();
+    EXPECT_EQ(store.copyToken(), std::nullopt);
+    EXPECT_EQ(log.entries(),
+              std::vector(
+                  4, RecordingLog::unifiedLine(LogLevel::error, "The voicemail store could not be written")));
+    std::fflush(nullptr);
+    ::_exit(testing::Test::HasFailure() ? 1 : 0);
+  }
+  int status = -1;
+  ::waitpid(child, &status, 0);
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(store.copyToken(), token);
+}
+
+TEST_F(SqliteVoicemailStoreTest, InAUserNamespaceWithoutTheAccountNothingIsWrittenAndNothingIsLeft) {
+  // Owned by nobody the store may not be; its folder is not made either.
+  const uid_t uid = ::geteuid();
+  inPrivateMounts([&] {
+    if (uid == 0 && ::unshare(CLONE_NEWUSER) != 0) return;
+    RecordingLog log;
+    SqliteVoicemailStore of(home.path(), 501, 501);
+    of.setToken(&token);
+    EXPECT_EQ(of.copyToken(), std::nullopt);
+    EXPECT_EQ(log.entries(), (std::vector{RecordingLog::unifiedLine(
+                                 LogLevel::error, "The voicemail store could not be written")}));
+    EXPECT_TRUE(std::filesystem::is_empty(home.path()));
+  });
 }
 
 // ---- the subscription query
