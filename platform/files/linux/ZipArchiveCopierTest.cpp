@@ -3,12 +3,17 @@
 #include "platform/files/linux/ZipArchiveCopier.h"
 
 #include <gtest/gtest.h>
+#include <linux/filter.h>
+#include <linux/seccomp.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstddef>
 #include <cstring>
 #include <optional>
 #include <set>
@@ -324,6 +329,41 @@ TEST_F(ZipArchiveCopierTest, HostileArchivesAreRefusedWholeAndLeaveNothingAnywhe
         << hostile.what;
   }
   EXPECT_FALSE(isThere("/tmp/brenvik-absolute"));
+}
+
+// What RestrictSUIDSGID= of a service unit does to this call.
+void refuseOpenat2InThisProcess() {
+  sock_filter program[] = {
+      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
+      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_openat2, 0, 1),
+      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | ENOSYS),
+      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
+  };
+  const sock_fprog filter{std::size(program), program};
+  ASSERT_EQ(::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0), 0);
+  ASSERT_EQ(::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter), 0);
+  ASSERT_EQ(::syscall(SYS_openat2, -1, "", nullptr, 0), -1);
+  ASSERT_EQ(errno, ENOSYS);
+}
+
+TEST_F(ZipArchiveCopierTest, WhereOpenat2IsRefusedArchivesComeOutAllTheSame) {
+  ZipBuilder zip;
+  zip.file("top", "1").file("a/b/c", "2").directory("a/empty").link("a/link", "../top");
+  const std::string good = zip.build();
+  inPrivateMounts([&] {
+    refuseOpenat2InThisProcess();
+    EXPECT_EQ(unpack(good), 0);
+    EXPECT_EQ(contentOf(dir / "out/top"), "1");
+    EXPECT_EQ(contentOf(dir / "out/a/b/c"), "2");
+    EXPECT_EQ(contentOf(dir / "out/a/link"), "1");
+    EXPECT_EQ(statOf(dir / "out/a/empty").st_mode, S_IFDIR | 0755u);
+    std::filesystem::remove_all(dir / "out");
+    std::filesystem::remove(dir / "archive.zip");
+    for (const Hostile& hostile : hostileArchives()) {
+      EXPECT_NE(unpack(hostile.zip.build()), 0) << hostile.what;
+      EXPECT_EQ(everything(), std::set<std::string>{"archive.zip"}) << hostile.what;
+    }
+  });
 }
 
 TEST_F(ZipArchiveCopierTest, ARefusedEntryIsAFileErrorThatAHandlerMayPassOver) {

@@ -4,6 +4,7 @@
 
 #include <fcntl.h>
 #include <grp.h>
+#include <linux/capability.h>
 #include <seccomp.h>
 #include <sys/prctl.h>
 #include <sys/resource.h>
@@ -23,6 +24,13 @@ constexpr id_t kNobody = 65534;
 bool limit(__rlimit_resource what, rlim_t value) {
   const rlimit both{value, value};
   return ::setrlimit(what, &both) == 0;
+}
+
+// A process of root's has root's capabilities again after exec(2), however it was started.
+bool dropCapabilities() {
+  __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+  const __user_cap_data_struct none[_LINUX_CAPABILITY_U32S_3] = {};
+  return ::syscall(SYS_capset, &header, none) == 0;
 }
 
 bool filterSystemCalls() {
@@ -49,12 +57,14 @@ bool filterSystemCalls() {
 }  // namespace
 
 bool confineThisProcess() {
-  // Only root can, and in a user namespace there may be no other user to become: then the filter has to do.
+  // Only root can. Under the service unit it may not, and in a user namespace there may be no other user to
+  // become: then it stays as it is, without a capability and behind the filter.
   const bool isNobody = ::setgroups(0, nullptr) == 0 && ::setresgid(kNobody, kNobody, kNobody) == 0 &&
                         ::setresuid(kNobody, kNobody, kNobody) == 0;
   (void)isNobody;
-  if (!limit(RLIMIT_CORE, 0) || !limit(RLIMIT_FSIZE, 0) || !limit(RLIMIT_CPU, kProcessorSeconds) ||
-      !limit(RLIMIT_AS, kAddressSpace) || ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) {
+  if (!dropCapabilities() || !limit(RLIMIT_CORE, 0) || !limit(RLIMIT_FSIZE, 0) ||
+      !limit(RLIMIT_CPU, kProcessorSeconds) || !limit(RLIMIT_AS, kAddressSpace) ||
+      ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) {
     return false;
   }
   if (!filterSystemCalls()) return false;
