@@ -32,6 +32,16 @@ class Line {
 
 }  // namespace
 
+MessageId messageIdOf(std::string_view format, std::string_view line) noexcept {
+  __extension__ using Wide = unsigned __int128;
+  constexpr auto wide = [](std::uint64_t high, std::uint64_t low) { return Wide{high} << 64 | low; };
+  std::string_view text = format == "%s" ? line : format;
+  if (text.ends_with('\n')) text.remove_suffix(1);
+  Wide hash = wide(0x6C62272E07BB0142, 0x62B821756295C58D);
+  for (const char c : text) hash = (hash ^ static_cast<unsigned char>(c)) * wide(1 << 24, 0x13B);
+  return {static_cast<std::uint64_t>(hash >> 64), static_cast<std::uint64_t>(hash)};
+}
+
 LogSink* setLogSink(LogSink* sink) noexcept { return currentSink.exchange(sink); }
 
 void logUnifiedAt(const LogPlace& place, LogLevel level, const char* format, ...) noexcept {
@@ -42,7 +52,7 @@ void logUnifiedAt(const LogPlace& place, LogLevel level, const char* format, ...
   va_start(arguments, format);
   const Line line(format, arguments);
   va_end(arguments);
-  sink->unified(level, line.view(), place);
+  sink->unified(level, line.view(), place, messageIdOf(format, line.view()));
   errno = savedErrno;
 }
 
@@ -54,7 +64,7 @@ void logBsd(SyslogPriority priority, const char* format, ...) noexcept {
   va_start(arguments, format);
   const Line line(format, arguments);
   va_end(arguments);
-  sink->bsd(priority, line.view());
+  sink->bsd(priority, line.view(), messageIdOf(format, line.view()));
   errno = savedErrno;
 }
 

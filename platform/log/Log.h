@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <cstdint>
 #include <string_view>
 
 namespace brenvik {
@@ -19,14 +20,26 @@ struct LogPlace {
   const char* function;
 };
 
+// The journal's name for a log text, 128 bits: made of the text itself as it stands in the source (FNV-1a),
+// so it stays as long as the text does. The catalogue that explains the texts is made by the same rule.
+struct MessageId {
+  std::uint64_t high = 0;
+  std::uint64_t low = 0;
+  bool operator==(const MessageId&) const = default;
+};
+
+// Of a format without its trailing newline. A format of "%s" alone has no text of its own: the line's counts.
+MessageId messageIdOf(std::string_view format, std::string_view line) noexcept;
+
 // Where finished lines go. Implementations are called from any thread and never throw, block on a reader or
 // call back into the log. `line` is the whole text as written by the helper, control characters included;
 // escaping what a terminal or a log reader could misread is the sink's work.
 class LogSink {
  public:
   virtual ~LogSink() = default;
-  virtual void unified(LogLevel level, std::string_view line, const LogPlace& place) noexcept = 0;
-  virtual void bsd(SyslogPriority priority, std::string_view line) noexcept = 0;
+  virtual void unified(LogLevel level, std::string_view line, const LogPlace& place,
+                       const MessageId& id) noexcept = 0;
+  virtual void bsd(SyslogPriority priority, std::string_view line, const MessageId& id) noexcept = 0;
 };
 
 // Replaces the process-wide sink; returns the previous one. The sink must outlive its use; null discards

@@ -35,6 +35,14 @@ TEST(LogTest, ALineThatIsTooLongIsCutAndNotLost) {
   EXPECT_EQ(log.entries()[0].line, std::string(4095, 'x'));
 }
 
+TEST(LogTest, AMessageIdIsMadeOfTheTextAsItStandsInTheSource) {
+  // The published value of FNV-1a for "foobar".
+  EXPECT_EQ(messageIdOf("foobar", "line"), (MessageId{0x343E1662793C64BF, 0x6F0D3597BA446F18}));
+  EXPECT_EQ(messageIdOf("foobar\n", "line"), messageIdOf("foobar", "another line"));
+  EXPECT_EQ(messageIdOf("%s", "foobar"), messageIdOf("foobar", ""));
+  EXPECT_NE(messageIdOf("%s: %s", "foobar"), messageIdOf("foobar", ""));
+}
+
 TEST(LogTest, WithoutASinkNothingHappens) {
   LogSink* const before = setLogSink(nullptr);
   logUnified(LogLevel::error, "%d", 1);

@@ -28,11 +28,11 @@ class RecordingLog final : public LogSink {
   RecordingLog& operator=(const RecordingLog&) = delete;
   ~RecordingLog() override { setLogSink(previous_); }
 
-  void unified(LogLevel level, std::string_view line, const LogPlace&) noexcept override {
+  void unified(LogLevel level, std::string_view line, const LogPlace&, const MessageId&) noexcept override {
     const std::lock_guard lock(mutex_);
     entries_.push_back({Entry::Channel::unified, static_cast<int>(level), std::string(line)});
   }
-  void bsd(SyslogPriority priority, std::string_view line) noexcept override {
+  void bsd(SyslogPriority priority, std::string_view line, const MessageId&) noexcept override {
     const std::lock_guard lock(mutex_);
     entries_.push_back({Entry::Channel::bsd, static_cast<int>(priority), std::string(line)});
   }

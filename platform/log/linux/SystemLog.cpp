@@ -15,6 +15,7 @@
 
 #include <algorithm>
 #include <array>
+#include <cinttypes>
 #include <cstdio>
 #include <cstring>
 
@@ -24,6 +25,8 @@ namespace brenvik {
 namespace {
 
 constexpr char kJournalSocket[] = "/run/systemd/journal/socket";
+constexpr char kSyslogSocket[] = "/dev/log";
+constexpr std::string_view kJournalsSyslogSocket = "/run/systemd/journal/dev-log";
 
 // A finished line with everything escaped that could forge another line or drive a terminal.
 class EscapedLine {
@@ -77,6 +80,26 @@ bool journalIsThere() noexcept {
   return ::stat(kJournalSocket, &status) == 0 && S_ISSOCK(status.st_mode);
 }
 
+// Whether syslog(3) would end in the journal anyway, which is then better told natively.
+bool syslogIsTheJournal() noexcept {
+  std::array<char, 64> target;
+  const ssize_t size = ::readlink(kSyslogSocket, target.data(), target.size());
+  return size > 0 &&
+         std::string_view(target.data(), static_cast<std::size_t>(size)) == kJournalsSyslogSocket &&
+         journalIsThere();
+}
+
+class Id {
+ public:
+  explicit Id(const MessageId& id) noexcept {
+    std::snprintf(text_.data(), text_.size(), "%016" PRIx64 "%016" PRIx64, id.high, id.low);
+  }
+  std::string_view view() const noexcept { return {text_.data(), text_.size() - 1}; }
+
+ private:
+  std::array<char, 33> text_;
+};
+
 }  // namespace
 
 SystemLog::SystemLog(const char* identifier) noexcept : identifier_(identifier) {
@@ -85,7 +108,8 @@ SystemLog::SystemLog(const char* identifier) noexcept : identifier_(identifier) 
 
 SystemLog::~SystemLog() { ::closelog(); }
 
-void SystemLog::unified(LogLevel level, std::string_view line, const LogPlace& place) noexcept {
+void SystemLog::unified(LogLevel level, std::string_view line, const LogPlace& place,
+                        const MessageId& id) noexcept {
   const EscapedLine escaped(line);
   if (journalIsThere()) {
     const char digit = static_cast<char>('0' + static_cast<int>(level));
@@ -97,8 +121,9 @@ void SystemLog::unified(LogLevel level, std::string_view line, const LogPlace& p
     const Field file("CODE_FILE", place.file);
     const Field codeLine("CODE_LINE", {number.data(), static_cast<std::size_t>(digits)});
     const Field function("CODE_FUNC", place.function);
-    const std::array fields{message.io(), priority.io(), identifier.io(),
-                            file.io(),    codeLine.io(), function.io()};
+    const Field messageId("MESSAGE_ID", Id(id).view());
+    const std::array fields{message.io(),  priority.io(), identifier.io(), file.io(),
+                            codeLine.io(), function.io(), messageId.io()};
     if (::sd_journal_sendv(fields.data(), static_cast<int>(fields.size())) >= 0) return;
   }
   std::array<char, 8200> text;
@@ -108,9 +133,19 @@ void SystemLog::unified(LogLevel level, std::string_view line, const LogPlace& p
   (void)!::write(STDERR_FILENO, text.data(), static_cast<std::size_t>(size));
 }
 
-void SystemLog::bsd(SyslogPriority priority, std::string_view line) noexcept {
+void SystemLog::bsd(SyslogPriority priority, std::string_view line, const MessageId& id) noexcept {
   if (line.ends_with('\n')) line.remove_suffix(1);
   const EscapedLine escaped(line);
+  if (syslogIsTheJournal()) {
+    const char digit = static_cast<char>('0' + static_cast<int>(priority));
+    const Field message("MESSAGE", escaped.view());
+    const Field level("PRIORITY", {&digit, 1});
+    const Field identifier("SYSLOG_IDENTIFIER", identifier_);
+    const Field facility("SYSLOG_FACILITY", "3");
+    const Field messageId("MESSAGE_ID", Id(id).view());
+    const std::array fields{message.io(), level.io(), identifier.io(), facility.io(), messageId.io()};
+    if (::sd_journal_sendv(fields.data(), static_cast<int>(fields.size())) >= 0) return;
+  }
   ::syslog(LOG_DAEMON | static_cast<int>(priority), "%s", escaped.text());
 }
 

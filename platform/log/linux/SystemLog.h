@@ -10,6 +10,10 @@ namespace brenvik {
 // prefix of sd-daemon(3) while there is no journal socket; the BSD log on syslog(3), facility daemon. Lines
 // are escaped: a control character or a byte that is not UTF-8 is written as \xNN, one trailing newline of a
 // BSD line is dropped. Any thread.
+//
+// Every journal entry has the MESSAGE_ID of its text. syslog(3) cannot carry one: where /dev/log is the
+// journal's own socket, the BSD log's lines are handed to it natively, with the same identifier, priority and
+// facility.
 class SystemLog final : public LogSink {
  public:
   // `identifier` is kept, not copied: a string literal.
@@ -18,8 +22,9 @@ class SystemLog final : public LogSink {
   SystemLog(const SystemLog&) = delete;
   SystemLog& operator=(const SystemLog&) = delete;
 
-  void unified(LogLevel level, std::string_view line, const LogPlace& place) noexcept override;
-  void bsd(SyslogPriority priority, std::string_view line) noexcept override;
+  void unified(LogLevel level, std::string_view line, const LogPlace& place,
+               const MessageId& id) noexcept override;
+  void bsd(SyslogPriority priority, std::string_view line, const MessageId& id) noexcept override;
 
  private:
   const char* const identifier_;
