@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <CLI/CLI.hpp>
+#include <algorithm>
 #include <array>
 #include <chrono>
 #include <cmath>
@@ -204,6 +205,11 @@ Values collect(Parsed& parsed) {
   return values;
 }
 
+const char* globalHelp(std::string_view name) {
+  const auto& all = globalOptions();
+  return std::find_if(all.begin(), all.end(), [&](const Parameter& each) { return name == each.name; })->help;
+}
+
 }  // namespace
 
 int runCommandLine(int argc, const char* const* argv) {
@@ -219,11 +225,11 @@ int runCommandLine(int argc, const char* const* argv) {
     CLI::App app("Asks BrenvikMobileHelper for what it does for the telephony daemon.", kProgram);
     app.require_subcommand(1);
     app.set_version_flag("--version", std::string(kProgram) + " " BRENVIK_VERSION);
-    app.add_flag("--json", settings.asJson, "print one JSON object a line");
-    app.add_option("--timeout", settings.timeout, "seconds to wait for each answer, default 30")
+    app.add_flag("--json", settings.asJson, globalHelp("--json"));
+    app.add_option("--timeout", settings.timeout, globalHelp("--timeout"))
         ->option_text("SECONDS")
         ->check(CLI::Range(0.001, 4'000'000.0));
-    app.add_option("--socket", settings.socket, "the helper's service socket")->option_text("PATH");
+    app.add_option("--socket", settings.socket, globalHelp("--socket"))->option_text("PATH");
     app.footer("Exit status: 0 done; 1 the helper refused or could not do it; 2 wrong usage, or no helper.");
 
     std::map<std::string, CLI::App*> groups;

@@ -683,6 +683,17 @@ const std::string* Values::find(std::string_view name) const {
   return found == given_.end() ? nullptr : &found->second;
 }
 
+const std::vector<Parameter>& globalOptions() {
+  static const std::vector<Parameter> options{
+      {"--json", "print one JSON object a line", ValueKind::text, 0, {}, false, nullptr},
+      {"--timeout", "seconds to wait for each answer, default 30", ValueKind::text, 0, {}, false, "SECONDS"},
+      {"--socket", "the helper's service socket", ValueKind::path, 0, {}, false, "PATH"},
+      {"--version", "show the version", ValueKind::text, 0, {}, false, nullptr},
+      {"--help", "show what there is", ValueKind::text, 0, {}, false, nullptr},
+  };
+  return options;
+}
+
 const std::vector<Group>& commandGroups() {
   static const std::vector<Group> groups{
       {"prefs", "preference values"},

@@ -89,6 +89,8 @@ struct Group {
   const char* summary;
 };
 
+// What may stand anywhere on the command line.
+const std::vector<Parameter>& globalOptions();
 const std::vector<Group>& commandGroups();
 const std::vector<Command>& commandTable();
 
