@@ -420,10 +420,10 @@ TEST_F(ServerTest, ADeathThatBelongsToNoServerStopsTheProcessOnAnAssertion) {
   EXPECT_DEATH(
       {
         class StandardError final : public LogSink {
-          void unified(LogLevel, std::string_view line, const LogPlace&) noexcept override {
+          void unified(LogLevel, std::string_view line, const LogPlace&, const MessageId&) noexcept override {
             std::fprintf(stderr, "%.*s\n", static_cast<int>(line.size()), line.data());
           }
-          void bsd(SyslogPriority, std::string_view) noexcept override {}
+          void bsd(SyslogPriority, std::string_view, const MessageId&) noexcept override {}
         } sink;
         setLogSink(&sink);
         OnClientPortDied(stray, nullptr, registry);
