@@ -12,7 +12,6 @@
 #include <exception>
 #include <functional>
 #include <memory>
-#include <new>
 #include <string>
 #include <utility>
 
@@ -164,7 +163,7 @@ class RequestsOnFirstUse final : public RoutineTable {
   Handler find(std::int32_t id) const noexcept override {
     try {
       if (areas_ == nullptr) areas_ = make_();
-    } catch (const std::bad_alloc&) {
+    } catch (const std::exception&) {
       return [](void*, const Request&, Reply& reply) {
         reply.setStatus(kern::resourceShortage);
         return Outcome::refused;

@@ -4,6 +4,7 @@
 import os
 import plistlib
 import random
+import resource
 import signal
 import socket
 import struct
@@ -168,6 +169,30 @@ class HostileClients(HelperTest):
         with open(f"/proc/{self.daemon.pid}/stat", encoding="ascii") as stat:
             after = sum(map(int, stat.read().rsplit(")", 1)[1].split()[11:13]))
         self.assertLessEqual(after - before, 2, "clock ticks: it does not spin")
+
+    def without_descriptors(self, beyond):
+        """Lets the process have no more descriptors than it has now; its hard limit is `beyond` above that."""
+        top = max(int(number) for number in os.listdir(f"/proc/{self.daemon.pid}/fd")) + 1
+        resource.prlimit(self.daemon.pid, resource.RLIMIT_NOFILE, (top, top + beyond))
+
+    def test_without_descriptors_the_helpers_own_work_still_has_threads_of_its_own(self):
+        self.assert_served()
+        self.without_descriptors(beyond=36)
+        self.assertEqual(self.good.status("EnableRadioManagerLogs", struct.pack("<i", 1)), 0)
+        check = wire.simple("CheckLASDUpdate", struct.pack("<i", 0))
+        reply, _ = self.good.channel.exchange(check)
+        self.assertEqual(wire.check_status(check, reply, ndr=bytes(8)), 0)
+        eventually(lambda: {"LASDUpdater", "RadioManagerLog"} <= set(self.daemon.threads()), what="both threads")
+        self.assert_served()
+
+    def test_without_any_descriptor_work_is_refused_with_6_and_holds_nobody_up(self):
+        self.assert_served()
+        self.without_descriptors(beyond=0)
+        self.assertEqual(self.good.status("CheckLASDUpdate", struct.pack("<i", 0)), 6)
+        self.assertEqual(self.good.status("EnableRadioManagerLogs", struct.pack("<i", 1)), 0)
+        self.assert_served()
+        self.good.close()
+        self.assertEqual(self.daemon.wait(), 0, "the refused check holds the process no longer")
 
     def test_one_way_requests_are_served_and_not_answered(self):
         value = plistlib.dumps("one way")

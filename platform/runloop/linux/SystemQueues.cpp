@@ -125,17 +125,18 @@ class ThreadQueue final : public SystemQueue {
   void start() override {
     std::call_once(started_, [this] {
       try {
-        thread_ = std::thread([loop = loop_, quit = quit_, qualityOfService = qualityOfService_] {
-          applyQualityOfService(qualityOfService);
-          while (!quit->load()) {
-            if (loop->runOnce(kNoTimeOut) < 0) break;
-          }
-        });
+        // The kernel keeps 15 characters of a name. A thread that names itself needs no descriptor for that.
+        thread_ = std::thread(
+            [loop = loop_, quit = quit_, qualityOfService = qualityOfService_, name = label().substr(0, 15)] {
+              (void)::pthread_setname_np(::pthread_self(), name.c_str());
+              applyQualityOfService(qualityOfService);
+              while (!quit->load()) {
+                if (loop->runOnce(kNoTimeOut) < 0) break;
+              }
+            });
       } catch (const std::system_error&) {
         throw OutOfQueues();
       }
-      // The kernel keeps 15 characters.
-      (void)::pthread_setname_np(thread_.native_handle(), label().substr(0, 15).c_str());
     });
   }
 
