@@ -28,6 +28,7 @@ class FileContents {
 
  private:
   char* buffer();
+  int copyMapped(int source, int destination, off_t* offset, off_t end);
   int copyRange(int source, int destination, off_t offset, off_t length);
   int copyExtendedAttributes(int source, int destination);
 

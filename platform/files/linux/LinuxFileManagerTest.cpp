@@ -8,6 +8,7 @@
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
+#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -306,6 +307,27 @@ TEST_F(LinuxFileManagerTest, LargeAndSparseFilesAreCopiedByteForByte) {
   dir.file("large", large);
   EXPECT_EQ(copy("large", "large-copy"), kSuccess);
   EXPECT_TRUE(contentOf(dir / "large-copy") == large);
+  // The same between two file systems, whatever each of them can do.
+  if (::access("/dev/shm", W_OK) == 0) {
+    TemporaryDirectory memory("/dev/shm");
+    EXPECT_EQ(files.copyItem(dir / "large", memory / "there", IfPresent::fail), kSuccess);
+    EXPECT_EQ(files.copyItem(memory / "there", dir / "back", IfPresent::fail), kSuccess);
+    EXPECT_TRUE(contentOf(dir / "back") == large);
+  }
+  // One that shrinks and grows meanwhile: the copy ends, and nobody is killed.
+  const std::string changing = dir.file("changing", large);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    for (;;) {
+      if (::truncate(changing.c_str(), 100) != 0 || ::truncate(changing.c_str(), 3'000'001) != 0) ::_exit(1);
+    }
+  }
+  for (int i = 0; i < 20; ++i) {
+    EXPECT_EQ(copy("changing", "changing-copy"), kSuccess);
+    EXPECT_EQ(files.removeItem(dir / "changing-copy"), kSuccess);
+  }
+  ::kill(child, SIGKILL);
+  ::waitpid(child, nullptr, 0);
 
   const int fd = ::open((dir / "sparse").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
   ASSERT_EQ(::pwrite(fd, "begin", 5, 0), 5);
