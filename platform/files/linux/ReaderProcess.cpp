@@ -36,6 +36,7 @@ int ReaderProcess::start(const std::string& program, int input) {
   output_.reset(ends[0]);
   const UniqueFd theirs(ends[1]);
   (void)::fcntl(theirs.get(), F_SETPIPE_SZ, kPipe);  // smaller is only slower
+  if (::fcntl(output_.get(), F_SETFL, O_NONBLOCK) != 0) return errno;
 
   posix_spawn_file_actions_t actions;
   posix_spawnattr_t attributes;
@@ -84,11 +85,13 @@ int ReaderProcess::drain(std::chrono::steady_clock::time_point deadline,
     const auto left =
         std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
     if (left.count() <= 0) return ETIMEDOUT;
-    pollfd ready{output_.get(), POLLIN, 0};
-    const int polled = ::poll(&ready, 1, static_cast<int>(std::min<std::int64_t>(left.count(), 60'000)));
-    if (polled < 0 && errno != EINTR) return errno;
-    if (polled <= 0) continue;
     const ssize_t got = ::read(output_.get(), buffer.get(), std::min(kBuffer, wanted()));
+    if (got < 0 && errno == EAGAIN) {
+      pollfd ready{output_.get(), POLLIN, 0};
+      const int polled = ::poll(&ready, 1, static_cast<int>(std::min<std::int64_t>(left.count(), 60'000)));
+      if (polled < 0 && errno != EINTR) return errno;
+      continue;
+    }
     if (got < 0 && errno == EINTR) continue;
     if (got < 0) return errno;
     if (got == 0) return isComplete() ? 0 : EPIPE;
