@@ -9,10 +9,12 @@
 #include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
+#include <sys/time.h>
 #include <unistd.h>
 
 #include <array>
 #include <cerrno>
+#include <csignal>
 
 namespace brenvik {
 namespace {
@@ -31,6 +33,20 @@ bool dropCapabilities() {
   __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
   const __user_cap_data_struct none[_LINUX_CAPABILITY_U32S_3] = {};
   return ::syscall(SYS_capset, &header, none) == 0;
+}
+
+volatile std::sig_atomic_t isConfined = 0;
+
+// libseccomp loops for ever when it runs out of memory in the wrong place. Nothing has been read then, and
+// the helper waits: the process leaves after a quarter of a second, of which it needs a hundredth.
+bool limitTimeOfConfining() {
+  struct sigaction action {};
+  action.sa_handler = [](int) {
+    if (isConfined == 0) ::_exit(1);
+  };
+  action.sa_flags = SA_RESTART;
+  const itimerval once{{0, 0}, {0, 250'000}};  // processor time: a busy machine does not count
+  return ::sigaction(SIGPROF, &action, nullptr) == 0 && ::setitimer(ITIMER_PROF, &once, nullptr) == 0;
 }
 
 bool filterSystemCalls() {
@@ -67,7 +83,8 @@ bool confineThisProcess() {
       ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) {
     return false;
   }
-  if (!filterSystemCalls()) return false;
+  if (!limitTimeOfConfining() || !filterSystemCalls()) return false;
+  isConfined = 1;
   errno = 0;
   return ::syscall(SYS_getppid) == -1 && errno == EUCLEAN;
 }
