@@ -2,9 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/web/linux/curl/CurlWebClient.h"
 
-#include <arpa/inet.h>
 #include <curl/curl.h>
-#include <netinet/in.h>
 #include <strings.h>
 #include <sys/epoll.h>
 #include <sys/socket.h>
@@ -20,6 +18,7 @@
 #include <utility>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/web/linux/curl/ResponseHead.h"
 
 namespace brenvik {
 namespace {
@@ -31,8 +30,6 @@ constexpr const char kQueueLabel[] = "HTTP client";
 // Below this rate for the whole of the stall limit, a transfer is given up.
 constexpr long kStallBytesPerSecond = 200;
 constexpr int kMostRedirects = 10;
-// Of all header lines of one response; a sane server stays far below.
-constexpr std::size_t kLargestHeaders = std::size_t{256} * 1024;
 constexpr long kReceiveBufferSize = 256L * 1024;
 // Wake-ups for time-outs may be put off by this much.
 constexpr auto kTimerLeeway = milliseconds(1);
@@ -47,69 +44,17 @@ struct EasyCleanup {
 struct MultiCleanup {
   void operator()(CURLM* multi) const noexcept { (void)curl_multi_cleanup(multi); }
 };
-struct UrlCleanup {
-  void operator()(CURLU* url) const noexcept { curl_url_cleanup(url); }
-};
 struct ListCleanup {
   void operator()(curl_slist* list) const noexcept { curl_slist_free_all(list); }
 };
-struct TextCleanup {
-  void operator()(char* text) const noexcept { curl_free(text); }
-};
 using Easy = std::unique_ptr<CURL, EasyCleanup>;
 using Multi = std::unique_ptr<CURLM, MultiCleanup>;
-using Url = std::unique_ptr<CURLU, UrlCleanup>;
 using List = std::unique_ptr<curl_slist, ListCleanup>;
-using Text = std::unique_ptr<char, TextCleanup>;
 
 // Once a process and never undone: other parts may use the library too.
 bool startLibrary() noexcept {
   static const bool started = curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
   return started;
-}
-
-std::string partOf(CURLU* url, CURLUPart part) {
-  char* value = nullptr;
-  if (curl_url_get(url, part, &value, 0) != CURLUE_OK) return {};
-  const Text owned(value);
-  return value;
-}
-
-struct ParsedUrl {
-  std::string scheme;  // lower case
-  std::string host;    // without the brackets of an IPv6 address
-};
-
-// Nothing when the text is no URL: blanks and control characters in it included.
-std::optional<ParsedUrl> parseUrl(const std::string& text) {
-  if (text.find('\0') != std::string::npos) return std::nullopt;
-  const Url url(curl_url());
-  if (url == nullptr || curl_url_set(url.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK)
-    return std::nullopt;
-  ParsedUrl parsed{partOf(url.get(), CURLUPART_SCHEME), partOf(url.get(), CURLUPART_HOST)};
-  if (parsed.host.starts_with('[') && parsed.host.ends_with(']')) {
-    parsed.host = parsed.host.substr(1, parsed.host.size() - 2);
-  }
-  if (parsed.host.empty()) return std::nullopt;
-  return parsed;
-}
-
-// Addresses are not looked up, nor is this machine's own name, which libcurl knows by itself.
-bool needsLookUp(const std::string& host) {
-  in6_addr space{};
-  if (::inet_pton(AF_INET, host.c_str(), &space) == 1 || ::inet_pton(AF_INET6, host.c_str(), &space) == 1)
-    return false;
-  constexpr std::string_view kLocal = "localhost";
-  if (host.size() < kLocal.size()) return true;
-  const std::size_t before = host.size() - kLocal.size();
-  return ::strcasecmp(host.c_str() + before, kLocal.data()) != 0 || (before > 0 && host[before - 1] != '.');
-}
-
-std::string_view trimmed(std::string_view text) noexcept {
-  constexpr std::string_view kBlanks = " \t\r\n";
-  const auto first = text.find_first_not_of(kBlanks);
-  if (first == std::string_view::npos) return {};
-  return text.substr(first, text.find_last_not_of(kBlanks) - first + 1);
 }
 
 bool isRedirect(long status) noexcept {
@@ -146,8 +91,7 @@ struct CurlWebClient::Transfer {
   // Of the present attempt:
   List headerList;
   Easy easy;
-  std::size_t headerBytes = 0;
-  bool bodyBegun = false;
+  ResponseHead head;
   bool wayWasCellular = false;
   std::optional<WebErrorKind> ownVerdict;  // why one of our callbacks stopped it
 
@@ -155,6 +99,7 @@ struct CurlWebClient::Transfer {
   void finish(WebErrorKind kind) {
     if (response == nullptr) return;
     response->errorKind = kind;
+    response->headers = std::move(head.fields);
     if (kind != WebErrorKind::none) response->body = {};
     if (callbackQueue == nullptr || !completion) return;
     const auto done = std::make_shared<WebRequest::Completion>(std::move(completion));
@@ -176,20 +121,10 @@ std::size_t CurlWebClient::Transfer::onHeader(char* data, std::size_t, std::size
                                               void* self) noexcept {
   auto& transfer = *static_cast<Transfer*>(self);
   try {
-    const std::string_view line(data, size);
-    transfer.headerBytes += size;
-    if (transfer.headerBytes > kLargestHeaders) {
+    if (!transfer.head.takeLine(std::string_view(data, size))) {
       transfer.ownVerdict = WebErrorKind::malformedResponse;
       return 0;
     }
-    HeaderMap& headers = transfer.response->headers;
-    if (line.starts_with("HTTP/")) headers.clear();  // of an interim response before this one
-    if (transfer.bodyBegun) return size;             // trailer fields are not header fields
-    const auto colon = line.find(':');
-    if (colon == std::string_view::npos || colon == 0) return size;
-    const auto value = trimmed(line.substr(colon + 1));
-    const auto [at, isNew] = headers.try_emplace(std::string(trimmed(line.substr(0, colon))), value);
-    if (!isNew) at->second.append(", ").append(value);
     return size;
   } catch (...) {
     transfer.ownVerdict = WebErrorKind::outOfMemory;
@@ -205,7 +140,8 @@ std::size_t CurlWebClient::Transfer::onBody(char* data, std::size_t, std::size_t
     return 0;
   }
   try {
-    if (!std::exchange(transfer.bodyBegun, true)) {
+    if (!transfer.head.bodyHasBegun()) {
+      transfer.head.bodyBegins();
       curl_off_t announced = 0;
       if (curl_easy_getinfo(transfer.easy.get(), CURLINFO_CONTENT_LENGTH_DOWNLOAD_T, &announced) ==
               CURLE_OK &&
@@ -328,10 +264,8 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
       if (left <= milliseconds::zero()) return transfer->finish(WebErrorKind::timedOut);
     }
 
-    transfer->response->headers.clear();
     transfer->response->body.clear();
-    transfer->headerBytes = 0;
-    transfer->bodyBegun = false;
+    transfer->head = ResponseHead();
     transfer->wayWasCellular = false;
     transfer->ownVerdict.reset();
     transfer->easy.reset(curl_easy_init());

@@ -244,7 +244,7 @@ TEST_F(CurlWebClientTest, HeadersOfAnInterimResponseAndTrailersDoNotCount) {
     connection.write("HTTP/1.1 103 Early Hints\r\nEarly: yes\r\n\r\n");
     connection.write(
         "HTTP/1.1 200 OK\r\nTransfer-Encoding: chunked\r\nContent-Type: a\r\n\r\n3\r\nabc\r\n0\r\n");
-    connection.write("Content-Type: b\r\nLate: yes\r\n\r\n");
+    connection.write("Content-Type: b\r\nHTTP/like: yes\r\nLate: yes\r\n\r\n");
   });
   const auto response = fetch(server.url());
   expectKind(WebErrorKind::none, response);
