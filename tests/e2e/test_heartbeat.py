@@ -1,6 +1,9 @@
 # SPDX-License-Identifier: Apache-2.0
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-"""The cellular heartbeat of the real daemon, captured on the far end of an interface named pdp_ip0."""
+"""The cellular heartbeat of the real daemon, captured on the far end of an interface named pdp_ip0.
+
+How it keeps the process from leaving is in test_heartbeat_idle.
+"""
 import os
 import pathlib
 import socket
@@ -109,32 +112,6 @@ class RawSocket(HeartbeatTest):
         self.assertEqual(self.probes(), [])
         self.assertEqual(self.logs.lines, [])
 
-    def test_it_holds_the_process_without_any_client_and_lets_it_go_when_switched_off(self):
-        self.switch(1).close()
-        time.sleep(13)
-        self.assertTrue(self.daemon.running())
-        self.assertGreaterEqual(len(self.probes()), 6)
-        self.switch(0).close()
-        self.assertEqual(self.daemon.wait(20), 0)
-
-    def test_started_twice_and_stopped_once_it_is_silent_but_the_process_stays(self):
-        client = self.switch(1)
-        self.switch(1, client)
-        self.probes(1, 5)
-        self.switch(0, client)
-        client.close()
-        time.sleep(1)
-        self.probes()
-        time.sleep(13)
-        self.assertEqual(self.probes(), [])
-        self.assertTrue(self.daemon.running(), "the first token is still out")
-
-    def test_stopped_without_a_start_nothing_happens(self):
-        client = self.switch(0)
-        self.assertEqual(self.probes(), [])
-        client.close()
-        self.assertEqual(self.daemon.wait(20), 0)
-
     def sockets(self):
         """How many ICMP sockets are open in our network: one while a probe waits for its reply."""
         lines = pathlib.Path(f"/proc/{self.daemon.pid}/net/{self.socket_table}").read_text().splitlines()
@@ -222,9 +199,8 @@ class NoWayOut(HeartbeatTest):
         client = self.switch(1)
         time.sleep(3)
         self.assertEqual(self.logs.lines, [])
+        self.assertTrue(self.daemon.running())
         self.switch(0, client)
-        client.close()
-        self.assertEqual(self.daemon.wait(20), 0)
 
 
 if __name__ == "__main__":
