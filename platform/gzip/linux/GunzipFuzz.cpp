@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <zlib.h>
 
+#include <array>
 #include <cstdint>
 #include <cstdlib>
 #include <optional>
@@ -13,14 +14,14 @@ using namespace brenvik;
 
 namespace {
 
-constexpr std::size_t kLargest = std::size_t{1} << 20;
+constexpr std::size_t kLargest = 20'000;
 
 // The plain way: each member at once into memory. Nothing when it is not whole or too large.
 std::optional<std::string> atOnce(const std::uint8_t* data, std::size_t size) {
   std::string output;
   if (size == 0) return std::nullopt;
   while (size > 0) {
-    std::string member(kLargest + 1, '\0');
+    static std::array<char, kLargest + 1> member;
     z_stream stream{};
     if (::inflateInit2(&stream, 15 + 16) != Z_OK) return std::nullopt;
     stream.next_in = const_cast<Bytef*>(data);
@@ -28,7 +29,7 @@ std::optional<std::string> atOnce(const std::uint8_t* data, std::size_t size) {
     stream.next_out = reinterpret_cast<Bytef*>(member.data());
     stream.avail_out = static_cast<uInt>(member.size());
     const int result = ::inflate(&stream, Z_FINISH);
-    output.append(member, 0, stream.total_out);
+    output.append(member.data(), stream.total_out);
     data += stream.total_in;
     size -= stream.total_in;
     ::inflateEnd(&stream);
