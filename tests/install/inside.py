@@ -8,6 +8,7 @@ import os
 import pathlib
 import plistlib
 import pwd
+import socket
 import stat
 import struct
 import subprocess
@@ -111,6 +112,9 @@ def install():
     expect_equal(mobile.pw_dir, "/var/mobile")
     expect_equal(os.stat("/var/mobile").st_uid, mobile.pw_uid)
     expect(os.path.samefile("/private/var/mobile", "/var/mobile"), "/private/var leads to /var")
+    # The heartbeat's ping sockets, for which the service has no other right.
+    expect_equal(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").read_text().split(), ["0", "0"], "ping sockets")
+    socket.socket(socket.AF_INET, socket.SOCK_DGRAM, socket.IPPROTO_ICMP).close()
     for folder in ("/etc/brenvik/entitlements.d", "/usr/lib/brenvik/entitlements.d"):
         facts = os.stat(folder)
         expect_equal((facts.st_uid, stat.S_IMODE(facts.st_mode)), (0, 0o755), folder)
@@ -218,8 +222,8 @@ def nothing_is_lost_at_the_idle_edge():
     instances, each_time = 50, 20
     unit = pathlib.Path(f"/lib/systemd/system/{SERVICE}").read_text().replace(SOCKET, "edge@%i.socket")
     pathlib.Path("/run/systemd/system/edge@.service").write_text(unit)
-    socket = pathlib.Path(f"/lib/systemd/system/{SOCKET}").read_text().replace(PATH, "/run/edge/%i")
-    pathlib.Path("/run/systemd/system/edge@.socket").write_text(socket)
+    listening = pathlib.Path(f"/lib/systemd/system/{SOCKET}").read_text().replace(PATH, "/run/edge/%i")
+    pathlib.Path("/run/systemd/system/edge@.socket").write_text(listening)
     run("systemctl", "daemon-reload")
     # The test speaks for itself here, so its interpreter is entitled.
     file = pathlib.Path("/etc/brenvik/entitlements.d/70-test.plist")
