@@ -175,8 +175,10 @@ TEST(CatalogueLabelerTest, OverlongAndMalformedLanguagesAreFollowedAsFarAsTheyMa
   EXPECT_EQ(names({kIdentifiers[4]}, {"de--AT"}), (Texts{"Reise"}));
   EXPECT_EQ(names({kIdentifiers[4]}, {"", "-", "--", "de ", "d\xC3\xA9", std::string("de\0", 3), "fr"}),
             (Texts{"Voyage"}));
-  EXPECT_EQ(names({kIdentifiers[4]}, {std::string(100, 'd') + "-x", "abcdefghijklmno", "abcdefghijklmnop"}),
-            (Texts{"Travel"}));
+  // Put together beforehand: g++ 12 sees overlaps in a concatenation within a list that are not there.
+  std::string overlong(100, 'd');
+  overlong += "-x";
+  EXPECT_EQ(names({kIdentifiers[4]}, {overlong, "abcdefghijklmno", "abcdefghijklmnop"}), (Texts{"Travel"}));
   EXPECT_EQ(names({kIdentifiers[4]}, {"zh-yue-hans", "fr"}), (Texts{"旅行"}));
 }
 
