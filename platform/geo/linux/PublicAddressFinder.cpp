@@ -8,11 +8,18 @@
 #include <utility>
 
 namespace brenvik {
+namespace {
+
+constexpr const char* kNoThread = "no thread to wait on";
+
+}  // namespace
 
 PublicAddressFinder::PublicAddressFinder(MakeNetwork makeNetwork, WorkQueue& mainQueue)
     : makeNetwork_(std::move(makeNetwork)),
       mainQueue_(mainQueue),
-      stopFd_(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {}
+      stopFd_(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
+  if (!stopFd_.isValid()) throw OutOfQueues();
+}
 
 void PublicAddressFinder::find(Deliver deliver, WorkQueue& queue) {
   {
@@ -21,9 +28,19 @@ void PublicAddressFinder::find(Deliver deliver, WorkQueue& queue) {
     // The transaction posted for the first of them takes all.
     if (waiting_.size() > 1) return;
   }
-  queue.post([weak = weak_from_this()] {
-    if (const auto self = weak.lock()) self->runTransaction();
-  });
+  try {
+    queue.post([weak = weak_from_this()] {
+      if (const auto self = weak.lock()) self->runTransaction();
+    });
+  } catch (const OutOfQueues&) {
+    // Nobody is left waiting for a transaction that will not run: the next question has to post one.
+    std::vector<Deliver> asked;
+    {
+      const std::lock_guard lock(mutex_);
+      asked.swap(waiting_);
+    }
+    for (const auto& each : asked) each({{}, GeoError{kNoThread}});
+  }
 }
 
 void PublicAddressFinder::stop() noexcept {
@@ -51,7 +68,7 @@ void PublicAddressFinder::runTransaction() {
 }
 
 StunOutcome PublicAddressFinder::outcome() {
-  if (mainQueue_.isCurrent()) return {{}, GeoError{"no thread to wait on"}};
+  if (mainQueue_.isCurrent()) return {{}, GeoError{kNoThread}};
   StunTransactionId id{};
   // An id that can be guessed would let anybody answer.
   if (::getrandom(id.data(), id.size(), 0) != static_cast<ssize_t>(id.size())) {

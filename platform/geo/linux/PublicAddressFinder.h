@@ -23,10 +23,10 @@ class PublicAddressFinder : public std::enable_shared_from_this<PublicAddressFin
   // Makes the network of one transaction, whose waiting ends when the descriptor becomes readable.
   using MakeNetwork = std::function<std::unique_ptr<StunNetwork>(int stopFd)>;
 
-  // On the main queue no transaction runs: it waits. (A queue that has no thread of its own works there.)
+  // On the main queue no transaction runs: it waits. Throws OutOfQueues, here for want of a descriptor.
   PublicAddressFinder(MakeNetwork makeNetwork, WorkQueue& mainQueue);
 
-  // Any thread.
+  // Any thread. An error where the queue has no thread to start; that comes from within the call.
   void find(Deliver deliver, WorkQueue& queue);
   // Ends the transaction that runs; nothing is delivered from now on. Any thread.
   void stop() noexcept;

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <array>
 #include <charconv>
+#include <new>
 #include <utility>
 
 #include "platform/geo/linux/GeocoderAnswer.h"
@@ -53,37 +54,45 @@ void ReverseGeocoder::ask(Coordinate coordinate, Deliver deliver, const std::sha
   const auto turn = std::max(now, nextTurn_);
   if (turn - now > kLongestTurn) return answerOffline(coordinate, deliver, "too many requests");
   nextTurn_ = turn + kGeocoderPace;
-  if (turn == now) return send(coordinate, std::move(deliver), queue);
+  if (turn == now) return send(coordinate, deliver, queue);
   queue->postAfter(turn - now, [weak = weak_from_this(), coordinate, deliver = std::move(deliver),
-                                weakQueue = std::weak_ptr(queue)]() mutable {
+                                weakQueue = std::weak_ptr(queue)] {
     const auto self = weak.lock();
     const auto queueAgain = weakQueue.lock();
     if (self == nullptr || queueAgain == nullptr) return;
     const std::lock_guard lock(self->atWork_);
-    if (!self->closed_) self->send(coordinate, std::move(deliver), queueAgain);
+    if (!self->closed_) self->send(coordinate, deliver, queueAgain);
   });
 }
 
-void ReverseGeocoder::send(Coordinate coordinate, Deliver deliver, const std::shared_ptr<WorkQueue>& queue) {
+void ReverseGeocoder::send(Coordinate coordinate, const Deliver& deliver,
+                           const std::shared_ptr<WorkQueue>& queue) {
   std::string url = serverUrl_;
   while (url.ends_with('/')) url.pop_back();
   url +=
       "/reverse?format=jsonv2&lat=" + decimal(coordinate.latitude) + "&lon=" + decimal(coordinate.longitude);
   const HeaderMap headers{{"Accept", "application/json"},
                           {"User-Agent", "BrenvikMobileHelper/" BRENVIK_VERSION}};
-  const auto request = webClient_.makeRequest(WebRequestType::get, url, headers, webClient_.makeSession());
-  if (request == nullptr) return answerOffline(coordinate, deliver, "its URL cannot be used");
-  request->setTimeLimit(kGeocoderPatience);
-  request->setLargestBody(kLargestGeocoderAnswer);
-  request->setCallbackQueue(queue);
-  request->setCompletion([weak = weak_from_this(), coordinate,
-                          deliver = std::move(deliver)](const std::shared_ptr<WebResponse>& response) {
-    const auto self = weak.lock();
-    if (self == nullptr) return;
-    const std::lock_guard lock(self->atWork_);
-    if (!self->closed_) self->takeResponse(coordinate, deliver, response);
-  });
-  request->send({});
+  const char* refusal = "its URL cannot be used";
+  try {
+    const auto request = webClient_.makeRequest(WebRequestType::get, url, headers, webClient_.makeSession());
+    if (request != nullptr) {
+      request->setTimeLimit(kGeocoderPatience);
+      request->setLargestBody(kLargestGeocoderAnswer);
+      request->setCallbackQueue(queue);
+      request->setCompletion(
+          [weak = weak_from_this(), coordinate, deliver](const std::shared_ptr<WebResponse>& response) {
+            const auto self = weak.lock();
+            if (self == nullptr) return;
+            const std::lock_guard lock(self->atWork_);
+            if (!self->closed_) self->takeResponse(coordinate, deliver, response);
+          });
+      return request->send({});
+    }
+  } catch (const std::bad_alloc&) {
+    refusal = "no memory or thread is left to ask it";
+  }
+  answerOffline(coordinate, deliver, refusal);
 }
 
 void ReverseGeocoder::takeResponse(Coordinate coordinate, const Deliver& deliver,

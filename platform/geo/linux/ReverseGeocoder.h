@@ -50,7 +50,7 @@ class ReverseGeocoder : public std::enable_shared_from_this<ReverseGeocoder> {
 
  private:
   void ask(Coordinate coordinate, Deliver deliver, const std::shared_ptr<WorkQueue>& queue);
-  void send(Coordinate coordinate, Deliver deliver, const std::shared_ptr<WorkQueue>& queue);
+  void send(Coordinate coordinate, const Deliver& deliver, const std::shared_ptr<WorkQueue>& queue);
   void takeResponse(Coordinate coordinate, const Deliver& deliver,
                     const std::shared_ptr<WebResponse>& response);
   void answerOffline(Coordinate coordinate, const Deliver& deliver, const std::string& serverError);

@@ -173,6 +173,17 @@ TEST_F(ReverseGeocoderTest, WhenTheServerFailsTheGazetteerAnswersAndTheLogSaysSo
   expectOffline("URL cannot be used");
 }
 
+TEST_F(ReverseGeocoderTest, WithoutMemoryToAskTheServerTheGazetteerAnswers) {
+  web.exhausted = true;
+  ask(geocoder(kServer), kOslo);
+  ASSERT_EQ(answers.size(), 1U);
+  EXPECT_EQ(addressOf(answers[0]).countryCode, "NO");
+  EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                               LogLevel::standard,
+                               "geo service: the geocoder failed (no memory or thread is left to ask it), "
+                               "the offline gazetteer answers")});
+}
+
 TEST_F(ReverseGeocoderTest, WithoutServerAndGazetteerItIsAnError) {
   ask(geocoder("", "/nonexistent/gazetteer.db"), kOslo);
   EXPECT_EQ(answers.at(0).error.value().description,

@@ -11,6 +11,8 @@
 namespace brenvik {
 namespace {
 
+constexpr const char* kNoQueue = "the geo service has no thread to work on";
+
 // Puts the answer on the queue that the question named, if that still exists.
 template <typename Handler, typename Answer>
 void answerOn(const std::weak_ptr<WorkQueue>& queue, const Handler& handler, std::optional<Answer> answer,
@@ -32,11 +34,15 @@ class SystemGeoService::ReverseTicket final : public ReverseGeocodeTicket {
                        std::optional<MapItems> items, std::optional<GeoError> error) {
       answerOn(handlerQueue, handler, std::move(items), std::move(error));
     };
-    const auto queue = service_.placesQueue();
-    queue->post([geocoder = service_.geocoder_, coordinate = coordinate_, deliver = std::move(deliver),
-                 weakQueue = std::weak_ptr(queue)] {
-      if (const auto alive = weakQueue.lock()) geocoder->lookUp(coordinate, deliver, alive);
-    });
+    try {
+      const auto queue = service_.placesQueue();
+      queue->post([geocoder = service_.geocoder_, coordinate = coordinate_, deliver,
+                   weakQueue = std::weak_ptr(queue)] {
+        if (const auto alive = weakQueue.lock()) geocoder->lookUp(coordinate, deliver, alive);
+      });
+    } catch (const OutOfQueues&) {
+      deliver({}, GeoError{kNoQueue});
+    }
   }
 
  private:
@@ -57,14 +63,10 @@ class SystemGeoService::IpTicket final : public GeoIpTicket {
     };
     if (!ofThisDevice_) return deliver({{}, GeoError{"only this device's own address can be looked up"}});
     const std::lock_guard lock(service_.mutex_);
-    if (service_.addressQueue_ == nullptr) {
-      service_.addressFinder_ = std::make_shared<PublicAddressFinder>(
-          [server = service_.stunServer_](int stopFd) {
-            return std::make_unique<UdpStunNetwork>(server, stopFd);
-          },
-          service_.queues_.main());
-      service_.addressQueue_ =
-          service_.queues_.makeSerial("geo service: address", QualityOfService::standard);
+    try {
+      service_.makeAddressFinder();
+    } catch (const OutOfQueues&) {
+      return deliver({{}, GeoError{kNoQueue}});
     }
     service_.addressFinder_->find(std::move(deliver), *service_.addressQueue_);
   }
@@ -102,6 +104,15 @@ std::shared_ptr<WorkQueue> SystemGeoService::placesQueue() {
     placesQueue_ = queues_.makeSerial("geo service: places", QualityOfService::standard);
   }
   return placesQueue_;
+}
+
+void SystemGeoService::makeAddressFinder() {
+  if (addressQueue_ != nullptr) return;
+  auto finder = std::make_shared<PublicAddressFinder>(
+      [server = stunServer_](int stopFd) { return std::make_unique<UdpStunNetwork>(server, stopFd); },
+      queues_.main());
+  addressQueue_ = queues_.makeSerial("geo service: address", QualityOfService::standard);
+  addressFinder_ = std::move(finder);
 }
 
 std::unique_ptr<ReverseGeocodeTicket> SystemGeoService::makeReverseGeocodeTicket(Coordinate coordinate,

@@ -47,7 +47,10 @@ class SystemGeoService final : public GeoService {
  private:
   class ReverseTicket;
   class IpTicket;
+  // Throws OutOfQueues.
   std::shared_ptr<WorkQueue> placesQueue();
+  // Under mutex_. Throws OutOfQueues.
+  void makeAddressFinder();
 
   WorkQueues& queues_;
   const std::shared_ptr<CountryConfiguration> country_;

@@ -148,6 +148,100 @@ TEST_F(SystemGeoServiceTest, AnAnswerWhoseQueueIsGoneIsDropped) {
   answered.get_future().wait();
 }
 
+TEST_F(SystemGeoServiceTest, WithoutAThreadToWorkOnQuestionsEndInAnErrorAndLaterOnesAreAnswered) {
+  class QueuesThatRunOut final : public WorkQueues {
+   public:
+    explicit QueuesThatRunOut(WorkQueues& others) : others_(others) {}
+    WorkQueue& main() noexcept override { return others_.main(); }
+    WorkQueue& global() override { return others_.global(); }
+    std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
+      if (none) throw OutOfQueues();
+      return others_.makeSerial(std::move(label), qualityOfService);
+    }
+    std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t, std::uint32_t, WorkQueue::Task,
+                                                             WorkQueue::Task) override {
+      return nullptr;
+    }
+    bool none = true;
+
+   private:
+    WorkQueues& others_;
+  };
+  handlers->post([] {});  // its own thread is there
+  QueuesThatRunOut scarce(queues);
+  SilentServer gone;
+  gone.socket.reset();
+  settings.stunServer = gone.name;
+  SystemGeoService service(scarce, web, settings);
+  const auto problems = [&] {
+    std::promise<std::string> place;
+    std::promise<std::string> address;
+    service.makeReverseGeocodeTicket({59.9133, 10.739}, IncludeEta::no, ShiftLocations::ifNeeded, nullptr)
+        ->submit(
+            [&](const auto&, const std::optional<GeoError>& error) {
+              place.set_value(error ? error->description : "none");
+            },
+            nullptr, handlers);
+    service.makeGeoIpTicket(std::nullopt)
+        ->submit(
+            [&](const auto&, const std::optional<GeoError>& error) {
+              address.set_value(error ? error->description : "none");
+            },
+            nullptr, nullptr, handlers);
+    return place.get_future().get() + "; " + address.get_future().get();
+  };
+  EXPECT_EQ(problems(), "the geo service has no thread to work on; the geo service has no thread to work on");
+  scarce.none = false;
+  EXPECT_EQ(problems(), "none; the STUN server cannot be reached");
+}
+
+TEST(PublicAddressFinderTest, AQueueThatCannotStartLeavesNobodyWaiting) {
+  class Reluctant final : public WorkQueue {
+   public:
+    const std::string& label() const noexcept override { return label_; }
+    void post(Task task) override {
+      if (refuses) throw OutOfQueues();
+      task();
+    }
+    void postAfter(std::chrono::nanoseconds, Task) override {}
+    std::unique_ptr<Timer> makeTimer(std::chrono::nanoseconds, std::chrono::nanoseconds,
+                                     std::chrono::nanoseconds, Task) override {
+      return nullptr;
+    }
+    bool isCurrent() const noexcept override { return false; }
+    std::unique_ptr<DescriptorSource> watchDescriptor(int, std::uint32_t,
+                                                      RunLoop::DescriptorHandler) override {
+      return nullptr;
+    }
+    bool refuses = true;
+
+   private:
+    const std::string label_ = "reluctant";
+  };
+  class Nobody final : public StunNetwork {
+   public:
+    std::chrono::nanoseconds elapsed() override { return 0s; }
+    std::size_t findPeers(std::chrono::nanoseconds) override { return 0; }
+    bool send(std::size_t, std::span<const std::byte>) override { return false; }
+    Event wait(std::chrono::nanoseconds) override { return {}; }
+  };
+  ManualClock clock;
+  ManualWorkQueue mainQueue(clock);
+  Reluctant queue;
+  const auto finder =
+      std::make_shared<PublicAddressFinder>([](int) { return std::make_unique<Nobody>(); }, mainQueue);
+  std::vector<std::string> problems;
+  const auto ask = [&] {
+    finder->find([&](const StunOutcome& outcome) { problems.push_back(outcome.error.value().description); },
+                 queue);
+  };
+  ask();
+  queue.refuses = false;
+  ask();
+  EXPECT_EQ(problems, (std::vector<std::string>{"no thread to wait on",
+                                                "the name of the STUN server cannot be resolved"}));
+}
+
 TEST(PublicAddressFinderTest, QuestionsDuringATransactionShareTheNext) {
   // A network that finds nobody, and counts how often it was made.
   class Nobody final : public StunNetwork {
