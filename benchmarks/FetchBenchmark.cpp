@@ -259,6 +259,5 @@ int main(int argc, char** argv) {
   webServer = &server;
   return runAndCompare(argc, argv,
                        {{"100 MiB into memory / curl, too", "fetchIntoMemory", "fetchIntoMemoryByCurl", 1.05},
-                        {"100 MiB into memory / thrown away", "fetchIntoMemory", "fetchByCurl", 1.05},
                         {"200 MiB gunzipped / bare zlib", "gunzipIntoAFile", "bareZlibLoop", 1.05}});
 }

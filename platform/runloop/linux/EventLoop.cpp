@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/runloop/linux/EventLoop.h"
 
+#include <sched.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <time.h>
@@ -207,9 +208,21 @@ int EventLoop::runOnce(std::uint64_t timeOut) noexcept {
     // One at a time: what is ready and not handled now goes to the end of the kernel's queue, and a handler
     // may end the watching of any other.
     epoll_event ready{};
-    int count = descriptors_->wait(&ready, 1, toMilliseconds(timeOut));
-    if (count == -EINTR) continue;
-    if (count <= 0) return count;
+    int count = 0;
+    if (!std::exchange(ownTasksAreNext_, false) || !hasOwnTasks_) {
+      count = descriptors_->wait(&ready, 1, hasOwnTasks_ ? 0 : toMilliseconds(timeOut));
+      if (count == -EINTR) continue;
+      if (count < 0) return count;
+      ownTasksAreNext_ = hasOwnTasks_ && count > 0;
+    }
+    if (count == 0) {
+      if (!hasOwnTasks_) return 0;
+      // Whoever has just got a reply goes first where there is one processor: it waited for that, not for
+      // this.
+      (void)::sched_yield();
+      drainInbox();
+      return 1;
+    }
     const auto isTimers = [this](const epoll_event& event) {
       return timersSource_ != nullptr &&
              event.data.ptr == static_cast<const Descriptor*>(timersSource_.get())->entry();
@@ -251,7 +264,11 @@ void EventLoop::post(std::function<void()> task) {
     first = inbox_.empty();
     inbox_.push_back(std::move(task));
   }
-  if (first) wake();
+  if (onLoopThread()) {
+    hasOwnTasks_ = true;  // it is awake
+  } else if (first) {
+    wake();
+  }
 }
 
 void EventLoop::drainInbox() noexcept {
@@ -260,6 +277,7 @@ void EventLoop::drainInbox() noexcept {
     const std::lock_guard lock(inboxMutex_);
     tasks.swap(inbox_);
   }
+  hasOwnTasks_ = false;
   // What a task posts waits for the next wake-up, so that descriptors get their turn in between.
   for (auto& task : tasks) {
     task();

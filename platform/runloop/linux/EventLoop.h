@@ -94,6 +94,10 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   std::unique_ptr<DescriptorSource> timersSource_;
   bool timersPrepared_ = false;
   bool timersChanged_ = false;
+  // Loop thread only: the inbox holds what the thread has posted to itself, which takes no wake-up; and it is
+  // that inbox's turn, after a descriptor had its own.
+  bool hasOwnTasks_ = false;
+  bool ownTasksAreNext_ = false;
   std::atomic<std::thread::id> thread_;  // none: not started
   std::mutex inboxMutex_;
   std::vector<std::function<void()>> inbox_;

@@ -57,6 +57,34 @@ TEST_F(SystemQueuesTest, ReturnsAfterASourceWasHandled) {
   EXPECT_EQ(handled, 1);
 }
 
+TEST_F(SystemQueuesTest, WhatTheLoopPostsToItselfAndDescriptorsTakeTurns) {
+  const UniqueFd ready(::eventfd(1, EFD_CLOEXEC));  // never read: always ready
+  ASSERT_TRUE(ready.isValid());
+  int served = 0;
+  const auto source = loop->addDescriptor(ready.get(), EPOLLIN, [&](std::uint32_t) { ++served; });
+  SystemQueues queues(*loop);
+  std::vector<int> servedBefore;
+  std::function<void()> again = [&] {
+    servedBefore.push_back(served);
+    if (servedBefore.size() < 5) queues.main().post(again);
+  };
+  queues.main().post(again);
+  runUntil([&] { return servedBefore.size() == 5; });
+  EXPECT_EQ(servedBefore, (std::vector<int>{1, 2, 3, 4, 5}));
+}
+
+TEST_F(SystemQueuesTest, WhatTheLoopPostsToItselfRunsWithoutAnyOtherReasonToWake) {
+  SystemQueues queues(*loop);
+  int ran = 0;
+  queues.main().post([&] { queues.main().post([&] { ++ran; }); });
+  runUntil([&] { return ran == 1; });
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::timedOut);
+  // Another thread's task that finds the inbox in use needs no wake-up of its own either.
+  queues.main().post([&] { ++ran; });
+  std::thread([&] { queues.main().post([&] { ++ran; }); }).join();
+  runUntil([&] { return ran == 3; });
+}
+
 TEST_F(SystemQueuesTest, StopEndsARunFromAnyThreadAndAlsoTheNextRun) {
   std::thread other([&] { loop->stop(); });
   EXPECT_EQ(loop->run(kNoTimeOut, ReturnAfterSource::no), RunResult::stopped);
