@@ -188,8 +188,6 @@ bool EventLoop::onLoopThread() const noexcept {
   return thread_.load(std::memory_order_relaxed) == std::this_thread::get_id();
 }
 
-void EventLoop::leaveToAnotherThread() noexcept { thread_.store({}, std::memory_order_relaxed); }
-
 int EventLoop::runOnce(std::uint64_t timeOut) noexcept {
   thread_.store(std::this_thread::get_id(), std::memory_order_relaxed);
   for (;;) {

@@ -46,10 +46,8 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   void post(std::function<void()> task);
   // Makes a waiting runOnce() return. Any thread, async-signal-safe.
   void wake() noexcept;
-  // At first the thread that made the loop.
+  // Whether this is the loop's thread: before the first runOnce(), see For.
   bool onLoopThread() const noexcept;
-  // The maker's word that another thread will run the loop; until that does, no thread is the loop's.
-  void leaveToAnotherThread() noexcept;
 
   // Loop thread only.
   std::unique_ptr<DescriptorSource> addDescriptor(int fd, std::uint32_t events,

@@ -106,9 +106,7 @@ class ThreadQueue final : public SystemQueue {
   ThreadQueue(std::shared_ptr<EventLoop> loop, std::string label, QualityOfService qualityOfService)
       : SystemQueue(std::move(loop), std::move(label)),
         qualityOfService_(qualityOfService),
-        quit_(std::make_shared<std::atomic<bool>>(false)) {
-    loop_->leaveToAnotherThread();
-  }
+        quit_(std::make_shared<std::atomic<bool>>(false)) {}
 
   ~ThreadQueue() override {
     quit_->store(true);
