@@ -32,6 +32,7 @@
 #include <fstream>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -363,16 +364,18 @@ bool compareStarts(const std::string& daemonPath, const std::string& barePath, i
 int main(int argc, char** argv) {
   using namespace brenvik;
   const int rounds = argc > 1 ? std::atoi(argv[1]) : 25;
-  if (rounds < 1) {
-    std::fprintf(stderr, "usage: TransportBenchmark [ROUNDS]\n");
+  const std::string_view only = argc > 2 ? argv[2] : "";
+  if (rounds < 1 || !(only.empty() || only == "calls" || only == "regions" || only == "starts")) {
+    std::fprintf(stderr, "usage: TransportBenchmark [ROUNDS [calls | regions | starts]]\n");
     return 2;
   }
   pinToOneProcessor();
   const Entitlement entitlement;
   const std::string bare = self().parent_path() / "BareServer";
   const std::string daemon = self().parent_path().parent_path() / "BrenvikMobileHelper";
-  const bool calls = compareCalls(daemon, bare, rounds);
-  const bool regions = compareRegions(bare, rounds);
-  const bool starts = compareStarts(daemon, bare, rounds);
+  const auto isWanted = [only](std::string_view part) { return only.empty() || only == part; };
+  const bool calls = !isWanted("calls") || compareCalls(daemon, bare, rounds);
+  const bool regions = !isWanted("regions") || compareRegions(bare, rounds);
+  const bool starts = !isWanted("starts") || compareStarts(daemon, bare, rounds);
   return calls && regions && starts ? 0 : 1;
 }
