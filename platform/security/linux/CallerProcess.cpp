@@ -43,19 +43,19 @@ std::string_view unitOfCgroups(std::string_view text) noexcept {
 std::optional<CallerProcess> CallerProcess::pin(const std::string& proc, pid_t pid, std::uint32_t startTime) {
   if (pid <= 0) return std::nullopt;
   const std::string path = proc + '/' + std::to_string(pid);
-  CallerProcess process(UniqueFd(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC)), startTime);
-  if (!process.folder_.isValid() || !process.isStillRunning()) return std::nullopt;
+  CallerProcess process(UniqueFd(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC)));
+  if (!process.folder_.isValid() || !process.runsSince(startTime)) return std::nullopt;
   return process;
 }
 
-bool CallerProcess::isStillRunning() const noexcept {
+bool CallerProcess::runsSince(std::uint32_t startTime) const noexcept {
   const UniqueFd file(::openat(folder_.get(), "stat", O_RDONLY | O_CLOEXEC));
   if (!file.isValid()) return false;
   std::array<char, 1024> text;
   const ssize_t size = ::read(file.get(), text.data(), text.size());
   if (size <= 0) return false;
   const auto facts = parseProcessStat({text.data(), static_cast<std::size_t>(size)});
-  return facts && facts->startTime == startTime_ && facts->state != 'Z' && facts->state != 'X';
+  return facts && facts->startTime == startTime && facts->state != 'Z' && facts->state != 'X';
 }
 
 std::optional<CallerProcess::FileIdentity> CallerProcess::executable() const noexcept {

@@ -32,10 +32,7 @@ class CallerProcess {
   // Nothing when there is no such process, or it started at another time. `proc` is "/proc".
   static std::optional<CallerProcess> pin(const std::string& proc, pid_t pid, std::uint32_t startTime);
 
-  // Whether the process still runs (one that has exited and awaits its parent does not) and is the one that
-  // was pinned.
-  bool isStillRunning() const noexcept;
-  // The file that the process executes now.
+  // The file that the process executes now; nothing when it has exited, whether its parent knows or not.
   std::optional<FileIdentity> executable() const noexcept;
   // The same, open for reading; not valid when it cannot be opened.
   UniqueFd openExecutable() const noexcept;
@@ -43,10 +40,10 @@ class CallerProcess {
   std::string unit() const;
 
  private:
-  CallerProcess(UniqueFd folder, std::uint32_t startTime) noexcept
-      : folder_(std::move(folder)), startTime_(startTime) {}
+  explicit CallerProcess(UniqueFd folder) noexcept : folder_(std::move(folder)) {}
+  bool runsSince(std::uint32_t startTime) const noexcept;
+
   UniqueFd folder_;
-  std::uint32_t startTime_;
 };
 
 }  // namespace brenvik

@@ -121,8 +121,8 @@ class EntitlementFiles::Task final : public SecurityTask {
       if (lookInDirectory(directory, name, &answer)) break;
     }
     // Last, so that whatever was read was read while the caller was there: a process that has gone holds
-    // nothing, and its id may be somebody else's.
-    if (answer.value && !process_.isStillRunning()) return {};
+    // nothing, and one that has become another program holds what that one does.
+    if (answer.value && process_.executable() != executable_) return {};
     return answer;
   } catch (const std::bad_alloc&) {
     return {{}, true};
