@@ -20,7 +20,7 @@ class SystemBootstrap final : public Bootstrap {
   KernelReturn checkIn(const char* serviceName, PortName* receiveRight) noexcept override;
 
  private:
-  UniqueFd fromServiceManager(const char* serviceName) noexcept;
+  UniqueFd fromServiceManager(const char* serviceName);
   UniqueFd listenAt(const std::string& path, const char* serviceName) noexcept;
 
   SystemPortSpace& ports_;

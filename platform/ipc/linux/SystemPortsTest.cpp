@@ -706,9 +706,10 @@ class ServiceTest : public PortsTest {
     PortsTest::SetUp();
     std::string name = (std::filesystem::temp_directory_path() / "brenvik-ports-XXXXXX").string();
     ASSERT_NE(::mkdtemp(name.data()), nullptr);
-    directory = name;
+    root = name;
+    directory = root;
   }
-  void TearDown() override { std::filesystem::remove_all(directory); }
+  void TearDown() override { std::filesystem::remove_all(root); }
 
   std::string path() const { return directory + "/service"; }
   void listen() {
@@ -730,7 +731,8 @@ class ServiceTest : public PortsTest {
     return ::recv(fd.get(), &byte, 1, MSG_DONTWAIT | MSG_PEEK) == 0;
   }
 
-  std::string directory;
+  std::string root;       // of all that a test makes
+  std::string directory;  // where the bootstrap makes sockets
   PortName service = kNullPort;
   std::shared_ptr<RoutineSource> serviceSource;
 };
@@ -788,6 +790,90 @@ TEST_F(ServiceTest, AnotherInstancesSocketFileIsNotRemovedAtTheEnd) {
   serviceSource->invalidate();
   EXPECT_EQ(ports.dropReceiveRight(service), kern::success);
   EXPECT_TRUE(std::filesystem::exists(path()));
+}
+
+// What a service manager hands over, in a process of its own: the descriptors have fixed places there.
+class HandedOverTest : public ServiceTest {
+ protected:
+  struct Given {
+    int type = SOCK_SEQPACKET;
+    bool listens = true;
+  };
+  // Exits with 0 when the bootstrap took descriptor `taken`, with 1 when it made a socket of its own, and
+  // with 2 when a descriptor stayed open that should not, or a variable was left to programs started later.
+  [[noreturn]] void checkIn(const std::vector<Given>& given, const char* names, int taken,
+                            int pid = ::getpid(), const char* count = nullptr) {
+    ::unlink(path().c_str());
+    for (std::size_t i = 0; i < given.size(); ++i) {
+      const int fd = ::socket(AF_UNIX, given[i].type, 0);
+      sockaddr_un address{};
+      address.sun_family = AF_UNIX;
+      std::strcpy(address.sun_path, (directory + "/given" + std::to_string(i)).c_str());
+      ::unlink(address.sun_path);
+      if (::bind(fd, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) ::_exit(3);
+      if (given[i].listens && ::listen(fd, 1) != 0) ::_exit(3);
+      // Out of the way of the places, then into them: what stands there is not needed here.
+      const int high = ::fcntl(fd, F_DUPFD, 100);
+      ::close(fd);
+      places_.push_back(high);
+    }
+    for (std::size_t i = 0; i < places_.size(); ++i) ::dup2(places_[i], 3 + static_cast<int>(i));
+    for (const int high : places_) ::close(high);
+    const int end = 3 + static_cast<int>(given.size());
+    for (int fd = end; fd < 100; ++fd) ::close(fd);
+    ::setenv("LISTEN_PID", std::to_string(pid).c_str(), 1);
+    ::setenv("LISTEN_FDS", count != nullptr ? count : std::to_string(given.size()).c_str(), 1);
+    if (names != nullptr) ::setenv("LISTEN_FDNAMES", names, 1);
+    PortName name = kNullPort;
+    if (bootstrap().checkIn("service", &name) != kern::success) ::_exit(3);
+    for (int fd = 3; fd < end; ++fd) {
+      const int flags = ::fcntl(fd, F_GETFD);
+      if (pid == ::getpid() && (fd == taken ? flags != FD_CLOEXEC : flags != -1 && !isOurOwn(fd))) ::_exit(2);
+    }
+    if (pid == ::getpid() && (std::getenv("LISTEN_PID") != nullptr || std::getenv("LISTEN_FDS") != nullptr ||
+                              std::getenv("LISTEN_FDNAMES") != nullptr)) {
+      ::_exit(2);
+    }
+    ::_exit(std::filesystem::exists(path()) ? 1 : 0);
+  }
+
+ private:
+  // The socket that the bootstrap made may have got the place of one that it closed.
+  bool isOurOwn(int fd) const {
+    sockaddr_un address{};
+    socklen_t size = sizeof address;
+    return ::getsockname(fd, reinterpret_cast<sockaddr*>(&address), &size) == 0 && path() == address.sun_path;
+  }
+  std::vector<int> places_;
+};
+
+TEST_F(HandedOverTest, TheListeningDescriptorOfTheServicesNameIsTakenAndTheOthersAreClosed) {
+  EXPECT_EXIT(checkIn({{}}, "service", 3), testing::ExitedWithCode(0), "");
+  EXPECT_EXIT(checkIn({{}, {}, {}}, "other:service:service", 4), testing::ExitedWithCode(0), "");
+}
+
+TEST_F(HandedOverTest, WithoutOneOfItsNameTheServiceMakesItsOwnSocket) {
+  EXPECT_EXIT(checkIn({{}}, "servic", -1), testing::ExitedWithCode(1), "");
+  EXPECT_EXIT(checkIn({{}}, "services", -1), testing::ExitedWithCode(1), "");
+  EXPECT_EXIT(checkIn({{}}, nullptr, -1), testing::ExitedWithCode(1), "");
+  EXPECT_EXIT(checkIn({{}, {}}, "other", -1), testing::ExitedWithCode(1), "");
+}
+
+TEST_F(HandedOverTest, ADescriptorThatListensNotOrNotForDatagramsInOrderIsNotTaken) {
+  EXPECT_EXIT(checkIn({{.type = SOCK_SEQPACKET, .listens = false}}, "service", -1),
+              testing::ExitedWithCode(1), "");
+  EXPECT_EXIT(checkIn({{.type = SOCK_STREAM}}, "service", -1), testing::ExitedWithCode(1), "");
+}
+
+TEST_F(HandedOverTest, WhatIsMeantForAnotherProcessIsLeftAlone) {
+  EXPECT_EXIT(checkIn({{}}, "service", 3, ::getppid()), testing::ExitedWithCode(1), "");
+}
+
+TEST_F(HandedOverTest, ACountThatIsNoneOrTooLargeEndsAtTheDescriptorsThereAre) {
+  EXPECT_EXIT(checkIn({{}}, "service:", 3, ::getpid(), "2147483647"), testing::ExitedWithCode(0), "");
+  for (const char* const count : {"", "0", "-1", "1x", " 1", "99999999999"}) {
+    EXPECT_EXIT(checkIn({}, "service", -1, ::getpid(), count), testing::ExitedWithCode(1), "") << count;
+  }
 }
 
 TEST_F(ServiceTest, MessagesOfTheServicePortCarryTheKernelsWordOnTheirSender) {
