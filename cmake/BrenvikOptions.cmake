@@ -68,6 +68,11 @@ if(NOT BRENVIK_SANITIZE AND NOT BRENVIK_FUZZ AND CMAKE_BUILD_TYPE STREQUAL "Rele
   # Packed relocations: fewer pages to read at each start.
   add_link_options(-Wl,-z,relro,-z,now -Wl,-z,pack-relative-relocs -Wl,--as-needed -Wl,--gc-sections)
   add_compile_options(-ffunction-sections -fdata-sections)
+  # Log entries name their source file. It is named from the root of the sources, wherever that is, and whether a
+  # compiler cache has made the path relative to the build folder or not: what is installed is the same.
+  file(RELATIVE_PATH to_sources ${PROJECT_BINARY_DIR} ${PROJECT_SOURCE_DIR})
+  string(REGEX REPLACE "([^/])$" "\\1/" to_sources "${to_sources}")
+  add_compile_options(-fmacro-prefix-map=${PROJECT_SOURCE_DIR}/= -fmacro-prefix-map=${to_sources}=)
 endif()
 
 # ccache, where there is one, makes the sanitizer builds of a second run cheap.

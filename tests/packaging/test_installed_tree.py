@@ -35,10 +35,14 @@ class InstalledTree(unittest.TestCase):
         cls.root = pathlib.Path(folder.name)
         cache = (BUILD / "CMakeCache.txt").read_text()
         prefix = re.search(r"^CMAKE_INSTALL_PREFIX:\w+=/(.*)$", cache, flags=re.M)[1]
-        run("cmake", "--install", BUILD, env={**os.environ, "DESTDIR": str(cls.root)})
+        cls.install(cls.root)
         cls.prefix = cls.root / prefix
         cls.files = {str(each.relative_to(cls.prefix)) for each in cls.prefix.rglob("*") if not each.is_dir()}
         cls.pages = any("/man/" in each for each in cls.files)
+
+    @staticmethod
+    def install(root, **more):
+        run("cmake", "--install", BUILD, env={**os.environ, "DESTDIR": str(root)}, **more)
 
     def one(self, pattern):
         found = [each for each in self.files if re.fullmatch(pattern, each)]
@@ -62,6 +66,18 @@ class InstalledTree(unittest.TestCase):
             self.one(pattern)
         self.assertTrue((self.root / "etc/brenvik/entitlements.d").is_dir())
         self.assertTrue((self.root / "usr/lib/brenvik/entitlements.d").is_dir())
+
+    def test_installed_again_by_somebody_with_another_mask_it_is_the_same(self):
+        def facts(root):
+            # The mode of folders is the mask's, as cmake has it.
+            return {str(each.relative_to(root)): os.readlink(each) if each.is_symlink() else
+                    None if each.is_dir() else (each.stat().st_mode, each.read_bytes())
+                    for each in root.rglob("*")}
+        with tempfile.TemporaryDirectory(prefix="brenvik-tree-again-") as folder:
+            self.install(pathlib.Path(folder) / "deeper", umask=0o077)
+            first, second = facts(self.root), facts(pathlib.Path(folder) / "deeper")
+        self.assertEqual(first.keys(), second.keys())
+        self.assertEqual([each for each in first if first[each] != second[each]], [])
 
     def test_nothing_of_the_tests_is_installed(self):
         self.assertEqual([each for each in self.files if re.search(r"test|fake|geocoder|fuzz|command-pages", each, re.I)], [])
