@@ -2,13 +2,22 @@
 # SPDX-License-Identifier: Apache-2.0
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 """The life of the packages on a real system, from installation to purge. Runs in a container, as root, once."""
+import contextlib
 import ctypes
+import fcntl
 import glob
+import gzip
+import http.server
+import json
 import os
 import pathlib
 import plistlib
 import pwd
+import resource
+import select
 import socket
+import sqlite3
+import ssl
 import stat
 import struct
 import subprocess
@@ -52,6 +61,11 @@ def wait_for(condition, what, seconds=20):
 
 def log_of_the_helper():
     return run("journalctl", "-t", "BrenvikMobileHelper", "-o", "cat").stdout
+
+
+def starts_of(unit):
+    run("journalctl", "--sync")
+    return run("journalctl", "-o", "cat", "-u", unit, "-g", "^Started ", check=False).stdout.count("Started ")
 
 
 def bvhelperctl(*arguments, check=True):
@@ -98,10 +112,136 @@ def zip_of(entries):
                                                       len(body), 0)
 
 
+class Tunnel:
+    """A network interface whose far end is this object: what the kernel sends there is read here."""
+    TUNSETIFF, SIOCSIFFLAGS, SIOCSIFADDR, SIOCSIFNETMASK = 0x400454CA, 0x8914, 0x8916, 0x891C
+    TUN_WITHOUT_HEADER, UP_AND_RUNNING = 0x1001, 0x41
+
+    def __init__(self, name, address, mask="255.255.255.0"):
+        self.fd = os.open("/dev/net/tun", os.O_RDWR | os.O_NONBLOCK | os.O_CLOEXEC)
+        fcntl.ioctl(self.fd, self.TUNSETIFF, struct.pack("16sH22x", name.encode(), self.TUN_WITHOUT_HEADER))
+        with socket.socket(socket.AF_INET, socket.SOCK_DGRAM) as control:
+            for request, value in ((self.SIOCSIFADDR, address), (self.SIOCSIFNETMASK, mask)):
+                fcntl.ioctl(control, request, struct.pack("16sHH4s16x", name.encode(), socket.AF_INET, 0,
+                                                          socket.inet_aton(value)))
+            fcntl.ioctl(control, self.SIOCSIFFLAGS, struct.pack("16sH22x", name.encode(), self.UP_AND_RUNNING))
+
+    def __enter__(self):
+        return self
+
+    def __exit__(self, *_):
+        os.close(self.fd)
+
+    def echo_requests(self, atleast=0, seconds=0.0):
+        """The ICMP echo requests that have come, each a whole IPv4 packet."""
+        found, end = [], time.monotonic() + seconds
+        while True:
+            left = max(0.0, end - time.monotonic()) if len(found) < atleast else 0
+            if not select.select([self.fd], [], [], left)[0]:
+                return found
+            packet = os.read(self.fd, 2048)
+            if packet[0] == 0x45 and packet[9] == socket.IPPROTO_ICMP and packet[20] == 8:
+                found.append(packet)
+
+    def answer(self, request):
+        """The echo reply to a request: its addresses change places, and the checksum knows of the other type."""
+        total = struct.unpack_from("!H", request, 22)[0] + 0x0800
+        os.write(self.fd, request[:12] + request[16:20] + request[12:16] + b"\0\0"
+                 + struct.pack("!H", (total & 0xFFFF) + (total >> 16)) + request[24:])
+
+
+@contextlib.contextmanager
+def names(**addresses):
+    """These host names are known: an underscore for each dot."""
+    hosts = pathlib.Path("/etc/hosts")
+    before = hosts.read_text() if hosts.exists() else ""
+    hosts.write_text(before + "".join(f"{address} {name.replace('_', '.')}\n" for name, address in addresses.items()))
+    try:
+        yield
+    finally:
+        hosts.write_text(before)
+
+
+@contextlib.contextmanager
+def web_server(host, files):
+    """Serves {path: content} by HTTPS at 127.0.0.1, with a certificate that this system trusts meanwhile."""
+    certificate, key = pathlib.Path("/run/brenvik-test.crt"), pathlib.Path("/run/brenvik-test.key")
+    run("openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt", "ec_paramgen_curve:P-256", "-nodes", "-days", "2",
+        "-subj", "/CN=test", "-addext", f"subjectAltName=DNS:{host}", "-keyout", key, "-out", certificate)
+    trusted = pathlib.Path("/etc/ssl/certs/ca-certificates.crt")
+    before = trusted.read_bytes()
+    trusted.write_bytes(before + certificate.read_bytes())
+
+    class Handler(http.server.BaseHTTPRequestHandler):
+        def do_GET(self):  # as the base class has it
+            content = files.get(self.path)
+            self.send_response(404 if content is None else 200)
+            self.send_header("Content-Type", "application/gzip" if self.path.endswith(".gz") else "application/xml")
+            self.send_header("Content-Length", str(len(content or b"")))
+            self.end_headers()
+            self.wfile.write(content or b"")
+
+        def log_message(self, *_):
+            pass
+
+    server = http.server.ThreadingHTTPServer(("127.0.0.1", 443), Handler)
+    context = ssl.SSLContext(ssl.PROTOCOL_TLS_SERVER)
+    context.load_cert_chain(certificate, key)
+    server.socket = context.wrap_socket(server.socket, server_side=True)
+    thread = threading.Thread(target=server.serve_forever)
+    thread.start()
+    try:
+        yield
+    finally:
+        server.shutdown()
+        thread.join()
+        server.server_close()
+        trusted.write_bytes(before)
+        certificate.unlink()
+        key.unlink()
+
+
+@contextlib.contextmanager
+def stun_server(seen_as):
+    """Answers one Binding request at 127.0.0.1 with this address."""
+    with socket.socket(socket.AF_INET, socket.SOCK_DGRAM) as server:
+        server.bind(("127.0.0.1", 3478))
+        server.settimeout(20)
+
+        def serve():
+            with contextlib.suppress(TimeoutError):
+                request, sender = server.recvfrom(2048)
+                mapped = bytes(a ^ b for a, b in zip(socket.inet_aton(seen_as), request[4:8]))
+                server.sendto(b"\1\1\0\x0c" + request[4:20] + b"\0\x20\0\x08\0\1\0\0" + mapped, sender)
+
+        thread = threading.Thread(target=serve)
+        thread.start()
+        try:
+            yield
+        finally:
+            thread.join()
+
+
 # ---- steps, in order -------------------------------------------------------------------------------------------
 
 
+PACKAGES = ("brenvik-mobile-helper", "bvhelperctl", "libbrenvik-mobile-helper0", "libbrenvik-mobile-helper-dev")
+# What is there before the packages come. What the package manager, accounts and the journal write is theirs.
+BEFORE = set()
+NOT_THE_PACKAGES_OWN = ("/proc", "/sys", "/dev", "/run", "/tmp", "/out", "/test", "/packages", "/var/lib/dpkg", "/var/log",
+                        "/var/cache", "/var/lib/systemd")
+
+
+def everything():
+    found = set()
+    for folder, folders, files in os.walk("/"):
+        folders[:] = [each for each in folders if os.path.join(folder, each) not in NOT_THE_PACKAGES_OWN]
+        found.update(os.path.join(folder, each) for each in folders + files)
+    return found
+
+
 def install():
+    BEFORE.update(everything())
     packages = [each for each in glob.glob("/packages/*.deb") if "upgrade" not in each]
     run("dpkg", "-i", *packages, env={**os.environ, "DEBIAN_FRONTEND": "noninteractive"})
     expect_equal(property_of(SOCKET, "ActiveState"), "active", SOCKET)
@@ -115,9 +255,17 @@ def install():
     # The heartbeat's ping sockets, for which the service has no other right.
     expect_equal(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").read_text().split(), ["0", "0"], "ping sockets")
     socket.socket(socket.AF_INET, socket.SOCK_DGRAM, socket.IPPROTO_ICMP).close()
+    expect_equal(run("dpkg", "-V", *PACKAGES, check=False).stdout, "", "dpkg --verify")
     for folder in ("/etc/brenvik/entitlements.d", "/usr/lib/brenvik/entitlements.d"):
         facts = os.stat(folder)
         expect_equal((facts.st_uid, stat.S_IMODE(facts.st_mode)), (0, 0o755), folder)
+
+
+def passes_its_own_smoke_test():
+    """What a distribution would run of the source package (debian/tests)."""
+    run("/test/smoke")
+    run("rm", "/etc/brenvik/entitlements.d/50-bvhelperctl.plist")
+    run("systemctl", "stop", SERVICE)
 
 
 def refused_without_an_entitlement():
@@ -160,9 +308,128 @@ def works_in_its_sandbox():
     expect(not os.path.exists("/tmp/a.tcpk"), "the package is gone")
     bvhelperctl("carrier", "replace-link", "/target", "/private/var/mobile/Library/Carrier Bundle.bundle")
     expect_equal(os.readlink("/var/mobile/Library/Carrier Bundle.bundle"), "/target")
+    bvhelperctl("carrier", "create-link", "/target", "/private/var/mobile/Library/Carrier Bundles/a.link")
+    expect_equal(os.readlink(f"{bundles}/a.link"), "/target")
+    pathlib.Path("/tmp/logs").mkdir()
+    pathlib.Path("/tmp/logs/crash.txt").write_text("boom")
+    run("install", "-d", "-o", "mobile", "-g", "mobile", "/var/mobile/Library/Logs", "/var/mobile/Library/Logs/CrashReporter")
+    bvhelperctl("carrier", "copy-crash-logs", "/tmp/logs")
+    expect_equal(pathlib.Path("/var/mobile/Library/Logs/CrashReporter/logs/crash.txt").read_text(), "boom")
     expect_equal(bvhelperctl("labels", "badges", "--language", "de", "--label", "business").stdout, "G\n")
-    bvhelperctl("heartbeat", "on")
-    bvhelperctl("heartbeat", "off")
+    expect_equal(bvhelperctl("labels", "localized", "--language", "de", "--label", "travel").stdout, "Reise\n")
+
+
+def works_for_the_whole_phone():
+    """The routines whose work lies in files of others, in libraries that are not there, on the system bus."""
+    pathlib.Path("/var/lib/brenvik/Library/Preferences").mkdir(parents=True, exist_ok=True)
+    pathlib.Path("/var/lib/brenvik/Library/Preferences/com.example.all.plist").write_bytes(plistlib.dumps({"text": "for all"}))
+    expect_equal(bvhelperctl("prefs", "get-app", "com.example.all", "text").stdout, "for all\n")
+    bvhelperctl("prefs", "set", "com.example.all", "text", "for root")
+    expect_equal(bvhelperctl("prefs", "get-app", "com.example.all", "text").stdout, "for root\n")
+    bvhelperctl("prefs", "delete", "com.example.all", "text")
+    expect_equal(bvhelperctl("prefs", "get-app", "com.example.all", "text").stdout, "for all\n")
+
+    bvhelperctl("voicemail", "set-token", "--key", "a-key", "another-token")
+    bvhelperctl("voicemail", "clear")
+    expect_equal(bvhelperctl("voicemail", "token").stdout, "(no token)\n")
+    expect_equal(bvhelperctl("voicemail", "token", "--key", "a-key").stdout, "another-token\n")
+    bvhelperctl("voicemail", "reset")
+    expect_equal(bvhelperctl("voicemail", "subscribed").stdout, "not subscribed\n")
+    bvhelperctl("voicemail", "set-token", "a-token")
+
+    folder = pathlib.Path("/var/mobile/Library/AddressBook")
+    folder.mkdir()
+    with contextlib.closing(sqlite3.connect(folder / "contacts.db", isolation_level=None)) as contacts:
+        contacts.execute("CREATE TABLE contact_channels(contact_id INTEGER NOT NULL, channel_identifier TEXT NOT NULL)")
+        contacts.execute("INSERT INTO contact_channels VALUES(1, 'old')")
+        # As the account has its files: nothing but root's right to overlook that lets the helper in.
+        mobile = pwd.getpwnam("mobile")
+        for path, mode in ((folder, 0o700), (folder / "contacts.db", 0o600)):
+            os.chown(path, mobile.pw_uid, mobile.pw_gid)
+            os.chmod(path, mode)
+        bvhelperctl("contacts", "remap", "old", "new")
+        expect_equal(contacts.execute("SELECT * FROM contact_channels").fetchall(), [(1, "new")])
+
+    pathlib.Path("/var/lib/brenvik/country.plist").write_bytes(plistlib.dumps({"CountryCode": "NO"}))
+    expect_equal(bvhelperctl("location", "country").stdout, "NO\n")
+
+    os.makedirs("/run/dbus", exist_ok=True)
+    with socket.socket(socket.AF_UNIX, socket.SOCK_STREAM) as bus:
+        bus.settimeout(10)
+        bus.bind("/run/dbus/system_bus_socket")
+        bus.listen(1)
+        bvhelperctl("radio-logs", "on")
+        with bus.accept()[0] as connection:
+            connection.settimeout(10)
+            expect(connection.recv(64).startswith(b"\0AUTH"), "somebody speaks to the bus")
+    os.unlink("/run/dbus/system_bus_socket")
+
+
+def asks_the_network():
+    """A database over HTTPS, the address under which the machine is seen, and where a place is: the answers arrive at the
+    telephony daemon."""
+    host, content = "lasd.norvale.example", b"of today\n" * 1000
+    manifest = {"gsm": {"Version": "1.0", "ContentURL": f"https://{host}/gsm.db.gz"}}
+    files = {"/1/v3/lasd.plist": plistlib.dumps(manifest), "/gsm.db.gz": gzip.compress(content)}
+    with contextlib.ExitStack() as stack:
+        stack.enter_context(names(lasd_norvale_example="127.0.0.1", stun_norvale_example="127.0.0.1"))
+        stack.enter_context(web_server(host, files))
+        stack.enter_context(stun_server("203.0.113.9"))
+        daemon = stack.enter_context(subprocess.Popen(["brenvik-standin", "--json"], stdout=subprocess.PIPE,
+                                                      stderr=subprocess.PIPE, text=True))
+        stack.callback(daemon.terminate)
+        expect("listening" in daemon.stderr.readline(), "the telephony daemon")
+
+        def heard():
+            expect(select.select([daemon.stdout], [], [], 20)[0], "nothing arrives at the telephony daemon")
+            event = json.loads(daemon.stdout.readline())
+            return event["event"], event["values"]
+
+        bvhelperctl("lasd", "check", "--type", "gsm")
+        kind, values = heard()
+        expect_equal((kind, values["Notification"], values.get("DBType")),
+                     ("notification", "com.norvale.lasd.UpdateAvailable", "gsm"))
+        bvhelperctl("location", "wan-ip")
+        kind, values = heard()
+        expect_equal((kind, values["Address"]), ("local-address", "203.0.113.9"))
+        bvhelperctl("location", "civic", "59.9133", "10.739")
+        kind, values = heard()
+        expect_equal((kind, values["CountryCode"], values["City"]), ("civic-info", "NO", "Oslo"))
+    expect_equal(pathlib.Path("/var/mobile/Library/LASD/gsm.db").read_bytes(), content)
+    expect_equal(plistlib.loads(pathlib.Path("/root/Library/Preferences/com.norvale.lasd.plist").read_bytes()), manifest)
+
+
+def beats_over_the_cellular_link():
+    """With the kernel's ping sockets: neither a raw socket nor a packet socket is allowed. The better way to the address is
+    another, so the interface is chosen by the helper."""
+    def waiting():
+        return len(pathlib.Path("/proc/net/icmp").read_text().splitlines()) - 1
+
+    with Tunnel("pdp_ip0", "10.5.0.1") as cellular, Tunnel("wifi0", "192.0.2.2") as other:
+        bvhelperctl("heartbeat", "on")
+        identifier = int(property_of(SERVICE, "MainPID")) & 0xFFFF
+        arrivals = []
+        for number in range(4):  # of the start, of the timer's first firing, and of two more
+            requests = cellular.echo_requests(1, 10)
+            expect_equal(len(requests), 1, "echo requests that arrive at the far end")
+            request = requests[0]
+            arrivals.append(time.monotonic())
+            expect_equal((socket.inet_ntoa(request[16:20]), len(request)), ("192.0.2.1", 20 + 48), "the request")
+            expect_equal(struct.unpack_from("!HH", request, 24), (identifier, 0), "identifier and sequence number")
+            expect_equal(waiting(), 1, "sockets that wait for a reply")
+            cellular.answer(request)
+            if number > 0:
+                wait_for(lambda: waiting() == 0, "the reply ends the wait", 0.5)
+        # The second waits for the reply to the first, which would be a second's wait without one.
+        expect(arrivals[1] - arrivals[0] < 0.5, f"the second request after {arrivals[1] - arrivals[0]:.2f} s")
+        for earlier, later in zip(arrivals[1:], arrivals[2:]):
+            expect(1.5 < later - earlier < 2.5, f"requests {later - earlier:.2f} s apart")
+        bvhelperctl("heartbeat", "off")
+        time.sleep(0.2)
+        cellular.echo_requests()
+        time.sleep(2.5)
+        expect_equal(cellular.echo_requests(), [], "after it was switched off")
+        expect_equal(other.echo_requests(), [], "by the other interface")
 
 
 def held_in_its_sandbox():
@@ -172,6 +439,7 @@ def held_in_its_sandbox():
     expect_equal(bvhelperctl("carrier", "unpack", "/tmp/bundle.zip", "/usr/bundle", check=False).returncode, 1)
     pathlib.Path("/home/secret.plist").write_bytes(plistlib.dumps({"a": 1}))
     expect_equal(bvhelperctl("plist", "load", "/home/secret.plist", check=False).returncode, 1)
+    os.unlink("/home/secret.plist")
     main = int(property_of(SERVICE, "MainPID"))
     status = pathlib.Path(f"/proc/{main}/status").read_text()
     fields = dict(line.split(":\t") for line in status.splitlines() if ":\t" in line)
@@ -216,6 +484,39 @@ def leaves_when_idle_and_comes_back():
     expect_equal(bvhelperctl("voicemail", "token").stdout, "a-token\n")
 
 
+def entitle_this_test():
+    """The test speaks for itself, so its interpreter is entitled."""
+    file = pathlib.Path("/etc/brenvik/entitlements.d/70-test.plist")
+    file.write_bytes(plistlib.dumps({"Executable": os.path.realpath(sys.executable),
+                                     "Entitlements": {"com.norvale.Teravox.BrenvikHelper.allow": True}}))
+    os.chmod(file, 0o644)
+
+
+def a_burst_is_one_start():
+    """Many clients at once find nobody at work: the first starts the helper, the others wait in the socket's queue."""
+    run("systemctl", "stop", SERVICE)
+    entitle_this_test()
+    before = starts_of(SERVICE)
+    library, answers = Library(), []
+    most = resource.getrlimit(resource.RLIMIT_NOFILE)[1]
+    resource.setrlimit(resource.RLIMIT_NOFILE, (most, most))
+    together = threading.Barrier(400)
+
+    def client():
+        together.wait()
+        answers.append(library.request(PATH))
+
+    threads = [threading.Thread(target=client) for _ in range(together.parties)]
+    for thread in threads:
+        thread.start()
+    for thread in threads:
+        thread.join()
+    wrong = [answer for answer in answers if answer != (0, "a-token")]
+    expect(not wrong, f"{len(wrong)} of {len(answers)} lost: {wrong[:5]}")
+    expect_equal(len(answers), len(threads), "answers")
+    expect_equal(starts_of(SERVICE) - before, 1, "starts")
+
+
 def nothing_is_lost_at_the_idle_edge():
     """1,000 requests around 50 idle edges: as many instances of the unit, each asked twenty times around the moment in
     which it leaves. The first of the twenty comes between 5 ms before that moment and 35 ms after it."""
@@ -225,11 +526,6 @@ def nothing_is_lost_at_the_idle_edge():
     listening = pathlib.Path(f"/lib/systemd/system/{SOCKET}").read_text().replace(PATH, "/run/edge/%i")
     pathlib.Path("/run/systemd/system/edge@.socket").write_text(listening)
     run("systemctl", "daemon-reload")
-    # The test speaks for itself here, so its interpreter is entitled.
-    file = pathlib.Path("/etc/brenvik/entitlements.d/70-test.plist")
-    file.write_bytes(plistlib.dumps({"Executable": os.path.realpath(sys.executable),
-                                     "Entitlements": {"com.norvale.Teravox.BrenvikHelper.allow": True}}))
-    os.chmod(file, 0o644)
     names = [f"edge@{i}.socket" for i in range(instances)]
     run("systemctl", "start", *names)
     library = Library()
@@ -256,24 +552,40 @@ def nothing_is_lost_at_the_idle_edge():
     expect_equal(len(flat), instances * each_time, "requests")
     wrong = [answer for answer in flat if answer != (0, "a-token")]
     expect(not wrong, f"{len(wrong)} of {len(flat)} lost: {wrong[:5]}")
-    starts = run("journalctl", "-o", "cat", "-u", "edge@*.service", "-g", "^Started ").stdout.count("Started ")
+    starts = starts_of("edge@*.service")
     print(f"    {len(flat)} requests, none lost; {starts} starts of {instances} instances", flush=True)
     expect(starts > instances + instances // 4, "too few edges were met for this to mean anything")
     run("systemctl", "stop", *names)
 
 
-def comes_back_after_a_limit():
-    folder = pathlib.Path(f"/run/systemd/system/{SERVICE}.d")
-    folder.mkdir(parents=True)
-    (folder / "broken.conf").write_text("[Unit]\nStartLimitBurst=5\n[Service]\nExecStart=\nExecStart=/bin/false\n")
+def hit_a_limit(result, **settings):
+    """With a helper that dies of every client, and these settings for the units, until one of their limits is hit."""
+    files = []
+    for unit, text in (("service", "[Service]\nExecStart=\nExecStart=/bin/false\n"), ("socket", "")):
+        files.append(pathlib.Path(f"/run/systemd/system/brenvik-mobile-helper.{unit}.d/broken.conf"))
+        files[-1].parent.mkdir(parents=True, exist_ok=True)
+        files[-1].write_text(text + settings[unit])
     run("systemctl", "stop", SERVICE)
     run("systemctl", "daemon-reload")
     bvhelperctl("--timeout", "5", "ping", check=False)
-    wait_for(lambda: property_of(SOCKET, "ActiveState") == "failed", "the start limit")
-    (folder / "broken.conf").unlink()
+    wait_for(lambda: property_of(SOCKET, "ActiveState") == "failed", "the limit")
+    expect_equal(property_of(SOCKET, "Result"), result)
+    for file in files:
+        file.unlink()
     run("systemctl", "daemon-reload")
     wait_for(lambda: property_of(SOCKET, "ActiveState") == "active", "the way back", 30)
     bvhelperctl("ping")
+
+
+def comes_back_after_a_limit():
+    hit_a_limit("service-start-limit-hit", service="[Unit]\nStartLimitBurst=5\n", socket="")
+    # The same way back, so it need not be waited for as long.
+    folder = pathlib.Path("/run/systemd/system/brenvik-mobile-helper-restore.service.d")
+    folder.mkdir()
+    (folder / "sooner.conf").write_text("[Service]\nExecStart=\nExecStart=/bin/sleep 2\n" + "".join(
+        line + "\n" for line in pathlib.Path("/lib/systemd/system/brenvik-mobile-helper-restore.service").read_text().splitlines()
+        if line.startswith("ExecStart=/bin/systemctl")))
+    hit_a_limit("trigger-limit-hit", service="[Unit]\nStartLimitBurst=1000\n", socket="[Socket]\nTriggerLimitBurst=5\n")
 
 
 def upgrade():
@@ -298,18 +610,23 @@ def remove():
 
 def purge():
     run("rm", *glob.glob("/etc/brenvik/entitlements.d/*"))
-    run("dpkg", "-P", "brenvik-mobile-helper", "bvhelperctl", "libbrenvik-mobile-helper-dev", "libbrenvik-mobile-helper0")
-    for path in ("/etc/brenvik", "/private", "/run/brenvik", "/var/lib/brenvik", "/usr/lib/brenvik"):
-        expect(not os.path.lexists(path), f"left behind: {path}")
+    run("dpkg", "-P", *PACKAGES)
+    # The user's data stay, and so do the accounts with the copies that their tools keep of the files.
+    left = [each for each in sorted(everything() - BEFORE)
+            if not (each + "/").startswith(("/root/Library/", "/var/mobile/"))
+            and each not in ("/etc/passwd-", "/etc/group-", "/etc/shadow-", "/etc/gshadow-", "/etc/.pwd.lock")]
+    expect_equal(left, [], "left behind")
+    expect(not os.path.exists("/run/brenvik"), "/run/brenvik is left behind")
     for path in ("/root/Library/Preferences/com.example.install.plist", "/var/mobile/Library/Voicemail/voicemail.db"):
         expect(os.path.exists(path), f"the user's, and gone: {path}")
     expect_equal(run("dpkg-query", "-W", "-f=${Package}\n", "*brenvik*", "bvhelperctl", check=False).stdout, "")
 
 
 def main():
-    steps = [install, refused_without_an_entitlement, served_with_one, works_in_its_sandbox, held_in_its_sandbox,
+    steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, works_in_its_sandbox, works_for_the_whole_phone,
+             asks_the_network, beats_over_the_cellular_link, held_in_its_sandbox,
              other_accounts_are_told_apart, journal_explains, leaves_when_idle_and_comes_back,
-             nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade, remove, purge]
+             a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade, remove, purge]
     for step in steps:
         began = time.monotonic()
         try:
