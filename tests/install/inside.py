@@ -591,7 +591,11 @@ def comes_back_after_a_limit():
 def upgrade():
     bvhelperctl("ping")
     process = property_of(SERVICE, "MainPID")
+    ping_sockets = pathlib.Path("/proc/sys/net/ipv4/ping_group_range")
+    ping_sockets.write_text("0 7")
     run("dpkg", "-i", "/packages/upgrade.deb")
+    expect_equal(ping_sockets.read_text().split(), ["0", "7"], "ping sockets that the administrator has opened")
+    expect_equal(run("dpkg", "-V", *PACKAGES, check=False).stdout, "", "dpkg --verify")
     expect_equal(property_of(SOCKET, "ActiveState"), "active", "listens on")
     expect_equal(property_of(SERVICE, "MainPID"), process, "a helper at work is left alone")
     expect_equal(bvhelperctl("voicemail", "token").stdout, "a-token\n")
