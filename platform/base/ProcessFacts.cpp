@@ -46,9 +46,8 @@ std::optional<ProcessFacts> processFacts(pid_t pid) noexcept {
   std::array<char, 32> path;
   std::snprintf(path.data(), path.size(), "/proc/%d/stat", static_cast<int>(pid));
   const UniqueFd file(::open(path.data(), O_RDONLY | O_CLOEXEC));
-  if (!file.isValid()) return std::nullopt;
   std::array<char, 1024> text;
-  const ssize_t size = ::read(file.get(), text.data(), text.size());
+  const ssize_t size = ::read(file.get(), text.data(), text.size());  // fails when nothing is open
   if (size <= 0) return std::nullopt;
   return parseProcessStat({text.data(), static_cast<std::size_t>(size)});
 }

@@ -50,9 +50,8 @@ std::optional<CallerProcess> CallerProcess::pin(const std::string& proc, pid_t p
 
 bool CallerProcess::runsSince(std::uint32_t startTime) const noexcept {
   const UniqueFd file(::openat(folder_.get(), "stat", O_RDONLY | O_CLOEXEC));
-  if (!file.isValid()) return false;
   std::array<char, 1024> text;
-  const ssize_t size = ::read(file.get(), text.data(), text.size());
+  const ssize_t size = ::read(file.get(), text.data(), text.size());  // fails when nothing is open
   if (size <= 0) return false;
   const auto facts = parseProcessStat({text.data(), static_cast<std::size_t>(size)});
   return facts && facts->startTime == startTime && facts->state != 'Z' && facts->state != 'X';
@@ -70,11 +69,10 @@ UniqueFd CallerProcess::openExecutable() const noexcept {
 
 std::string CallerProcess::unit() const {
   const UniqueFd file(::openat(folder_.get(), "cgroup", O_RDONLY | O_CLOEXEC));
-  if (!file.isValid()) return {};
   std::string text;
   std::array<char, 1024> part;
   for (;;) {
-    const ssize_t size = ::read(file.get(), part.data(), part.size());
+    const ssize_t size = ::read(file.get(), part.data(), part.size());  // fails when nothing is open
     if (size < 0 || text.size() > kLargestCgroupText) return {};
     if (size == 0) return std::string(unitOfCgroups(text));
     text.append(part.data(), static_cast<std::size_t>(size));

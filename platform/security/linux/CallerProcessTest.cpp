@@ -8,6 +8,9 @@
 #include <unistd.h>
 
 #include <csignal>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
 
 #include "platform/base/ProcessFacts.h"
 
@@ -87,6 +90,60 @@ TEST(CallerProcessTest, AProcessThatExitedRunsNoLongerWhetherItsParentKnowsOrNot
   ASSERT_EQ(::waitpid(child, nullptr, 0), child);
   EXPECT_FALSE(process->executable()) << "it is gone";
   EXPECT_FALSE(process->openExecutable().isValid());
+  EXPECT_EQ(process->unit(), "");
+}
+
+// A made-up /proc with the process 7, for what a real one is seldom caught at.
+class MadeUpProcessFolderTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    std::string name = (std::filesystem::temp_directory_path() / "caller-XXXXXX").string();
+    ASSERT_NE(::mkdtemp(name.data()), nullptr);
+    proc = name;
+    std::filesystem::create_directory(proc / "7");
+    writeStat('S', "100");
+  }
+  void TearDown() override { std::filesystem::remove_all(proc); }
+
+  void write(const char* name, const std::string& content) {
+    std::ofstream(proc / "7" / name, std::ios::binary) << content;
+  }
+  void writeStat(char state, const char* startTime) {
+    write("stat", std::string("7 (caller) ") + state + " 1 7 7 0 -1 0 0 0 0 0 0 0 0 0 20 0 1 0 " + startTime +
+                      " 0\n");
+  }
+  bool isThere() { return CallerProcess::pin(proc.string(), 7, 100).has_value(); }
+
+  std::filesystem::path proc;
+};
+
+TEST_F(MadeUpProcessFolderTest, AProcessThatIsBeingRemovedIsThereNoLonger) {
+  EXPECT_TRUE(isThere());
+  for (const char gone : {'Z', 'X'}) {
+    writeStat(gone, "100");
+    EXPECT_FALSE(isThere()) << gone;
+  }
+}
+
+TEST_F(MadeUpProcessFolderTest, FactsThatAreEmptyOrCutShortOrNoneAreNobodys) {
+  for (const char* const text : {"", "7 (caller) S 1 7", "nonsense"}) {
+    write("stat", text);
+    EXPECT_FALSE(isThere()) << text;
+  }
+  std::filesystem::remove(proc / "7/stat");
+  EXPECT_FALSE(isThere());
+}
+
+TEST_F(MadeUpProcessFolderTest, AListOfGroupsThatCannotBeReadOrNeverEndsGivesNoUnit) {
+  const std::string line = "0::/system.slice/caller.service\n";
+  const auto process = CallerProcess::pin(proc.string(), 7, 100);
+  ASSERT_TRUE(process);
+  EXPECT_EQ(process->unit(), "") << "no file";
+  write("cgroup", line);
+  EXPECT_EQ(process->unit(), "caller.service");
+  write("cgroup", std::string(60 << 10, '\n') + line);
+  EXPECT_EQ(process->unit(), "caller.service") << "long, but no longer than it may be";
+  write("cgroup", std::string(70 << 10, '\n') + line);
   EXPECT_EQ(process->unit(), "");
 }
 

@@ -10,7 +10,6 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <new>
 #include <optional>
 #include <utility>
 
@@ -57,7 +56,7 @@ std::vector<std::string> splitPath(std::string_view path) {
   std::vector<std::string> parts;
   while (!path.empty()) {
     const std::size_t colon = path.find(':');
-    if (colon != 0) parts.emplace_back(path.substr(0, colon));
+    parts.emplace_back(path.substr(0, colon));
     path.remove_prefix(colon == std::string_view::npos ? path.size() : colon + 1);
   }
   return parts;
@@ -95,7 +94,7 @@ std::optional<Entry> readEntry(const PropertyList& file) {
       !takeOptional(file, "SHA256", &entry.sha256)) {
     return std::nullopt;
   }
-  entry.user = user ? std::move(*user) : std::string(kDefaultUser);
+  entry.user = user.value_or(std::string(kDefaultUser));
   if (!isCString(entry.user)) return std::nullopt;
   entry.entitlements = file.find("Entitlements");
   if (!entry.entitlements.is(PropertyList::Type::dictionary)) return std::nullopt;
@@ -124,8 +123,8 @@ class EntitlementFiles::Task final : public SecurityTask {
     // nothing, and one that has become another program holds what that one does.
     if (answer.value && process_.executable() != executable_) return {};
     return answer;
-  } catch (const std::bad_alloc&) {
-    return {{}, true};
+  } catch (...) {
+    return {{}, true};  // out of memory
   }
 
  private:
@@ -138,7 +137,7 @@ class EntitlementFiles::Task final : public SecurityTask {
       return false;
     }
     struct stat facts {};
-    if (!folder.isValid() || ::fstat(folder.get(), &facts) != 0) return giveUpOn(directory, answer);
+    if (::fstat(folder.get(), &facts) != 0) return giveUpOn(directory, answer);  // also when none is open
     if (!isTrusted(facts)) {
       logUnified(LogLevel::error,
                  "entitlement directory %s passed over: not owned by root, or others may write to it",
@@ -155,25 +154,15 @@ class EntitlementFiles::Task final : public SecurityTask {
   bool lookInFile(int directory, const std::string& file, const std::string& path, std::string_view name,
                   Answer* answer) {
     PropertyList content;
-    switch (read(directory, file, path, &content)) {
-      case Verdict::passedOver:
-        return false;
-      case Verdict::undecidable:
-        return giveUpOn(path, answer);
-      case Verdict::matches:
-        break;
-    }
+    const Verdict isReadable = read(directory, file, path, &content);
+    if (isReadable == Verdict::undecidable) return giveUpOn(path, answer);
+    if (isReadable == Verdict::passedOver) return false;
     const auto entry = readEntry(content);
     if (!entry) return false;
     PropertyList value = entry->entitlements.find(name);
-    switch (judge(*entry, value.hasValue(), path)) {
-      case Verdict::passedOver:
-        return false;
-      case Verdict::undecidable:
-        return giveUpOn(path, answer);
-      case Verdict::matches:
-        break;
-    }
+    const Verdict isTheCallers = judge(*entry, value.hasValue(), path);
+    if (isTheCallers == Verdict::undecidable) return giveUpOn(path, answer);
+    if (isTheCallers == Verdict::passedOver) return false;
     answer->value = std::move(value);
     return true;
   }
@@ -195,8 +184,10 @@ class EntitlementFiles::Task final : public SecurityTask {
     // Neither a link out of the directory nor a pipe or a device that would hold us up.
     const UniqueFd fd(
         ::openat(directory, file.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-    if (!fd.isValid()) {
-      switch (errno) {
+    const int error = errno;
+    struct stat facts {};
+    if (::fstat(fd.get(), &facts) != 0) {  // as of a file that could not be opened
+      switch (error) {
         case ENOENT:
           return Verdict::passedOver;  // removed since it was listed
         case ELOOP:
@@ -207,21 +198,13 @@ class EntitlementFiles::Task final : public SecurityTask {
           return Verdict::undecidable;
       }
     }
-    struct stat facts {};
-    if (::fstat(fd.get(), &facts) != 0) return Verdict::undecidable;
     if (!S_ISREG(facts.st_mode)) return passOver(path, "not a regular file");
     if (!isTrusted(facts)) return passOver(path, "not owned by root, or others may write to it");
     if (static_cast<std::uint64_t>(facts.st_size) > kLargestFile) return passOver(path, "too large");
     std::vector<std::byte> bytes(static_cast<std::size_t>(facts.st_size));
-    std::size_t size = 0;
-    while (size < bytes.size()) {
-      const ssize_t part = ::read(fd.get(), bytes.data() + size, bytes.size() - size);
-      if (part < 0 && errno == EINTR) continue;
-      if (part < 0) return Verdict::undecidable;
-      if (part == 0) break;
-      size += static_cast<std::size_t>(part);
-    }
-    *content = parsePropertyList({bytes.data(), size});
+    // A regular file gives all it has at once, unless it fails or is being changed.
+    if (::read(fd.get(), bytes.data(), bytes.size()) != facts.st_size) return Verdict::undecidable;
+    *content = parsePropertyList(bytes);
     if (!content->is(PropertyList::Type::dictionary))
       return passOver(path, "not a property list of the right form");
     return Verdict::matches;
@@ -240,22 +223,28 @@ class EntitlementFiles::Task final : public SecurityTask {
     const auto running = executable();
     if (!running || *running != CallerProcess::FileIdentity{facts.st_dev, facts.st_ino})
       return Verdict::passedOver;
-    if (!S_ISREG(facts.st_mode) || !isTrusted(facts)) {
+    if (!isTrusted(facts)) {
       return passOver(path, "its executable is not owned by root, or others may write to it");
     }
     if (!hasKey) return Verdict::passedOver;
 
-    if (entry.unit && (entry.unit->empty() || process_.unit() != *entry.unit)) return Verdict::passedOver;
+    if (entry.unit && !runsIn(*entry.unit)) return Verdict::passedOver;
     return entry.sha256 ? judgeDigest(*entry.sha256) : Verdict::matches;
+  }
+
+  // No unit has an empty name, which is what a caller in none would show.
+  bool runsIn(const std::string& unit) const {
+    if (unit.empty()) return false;
+    return process_.unit() == unit;
   }
 
   Verdict judgeDigest(const std::string& hex) const noexcept {
     const auto wanted = parseSha256(hex);
     if (!wanted) return Verdict::passedOver;
     const UniqueFd fd = process_.openExecutable();
-    struct stat facts {};
     if (!fd.isValid() && (errno == ENOENT || errno == ESRCH)) return Verdict::passedOver;  // it has gone
-    if (!fd.isValid() || ::fstat(fd.get(), &facts) != 0) return Verdict::undecidable;
+    struct stat facts {};
+    if (::fstat(fd.get(), &facts) != 0) return Verdict::undecidable;  // also when it cannot be opened
     // It may have become another program since it was compared.
     if (executable_ != CallerProcess::FileIdentity{facts.st_dev, facts.st_ino}) return Verdict::passedOver;
     const auto digest = sha256OfFile(fd.get());
@@ -293,8 +282,8 @@ std::unique_ptr<SecurityTask> EntitlementFiles::makeTask(const AuditToken& calle
   auto process = CallerProcess::pin(proc_, caller.pid(), caller.pidVersion());
   if (!process) return nullptr;
   return std::make_unique<Task>(*this, std::move(*process), caller.uid());
-} catch (const std::bad_alloc&) {
-  return nullptr;
+} catch (...) {
+  return nullptr;  // out of memory
 }
 
 }  // namespace brenvik

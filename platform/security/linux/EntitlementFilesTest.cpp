@@ -9,11 +9,13 @@
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <array>
+#include <cerrno>
 #include <csignal>
 #include <cstdlib>
 #include <filesystem>
@@ -23,9 +25,28 @@
 #include "platform/accounts/fakes/FakeAccountDirectory.h"
 #include "platform/base/ProcessFacts.h"
 #include "platform/base/UniqueFd.h"
+#include "platform/base/fakes/FailingAllocations.h"
+#include "platform/base/fakes/FailingCalls.h"
+#include "platform/log/Log.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/plist/PropertyListCodec.h"
 #include "platform/security/linux/Sha256.h"
+
+// Calls of this program that a test may let fail. None of the opens here makes a file.
+extern "C" ssize_t read(int fd, void* bytes, std::size_t size) {
+  return brenvik::FailingCall::failsNow("read") ? -1 : ::syscall(SYS_read, fd, bytes, size);
+}
+extern "C" ssize_t getdents64(int fd, void* bytes, std::size_t size) noexcept {
+  return brenvik::FailingCall::failsNow("getdents64") ? -1 : ::syscall(SYS_getdents64, fd, bytes, size);
+}
+extern "C" int stat(const char* path, struct stat* facts) noexcept {
+  if (brenvik::FailingCall::failsNow("stat")) return -1;
+  return static_cast<int>(::syscall(SYS_newfstatat, AT_FDCWD, path, facts, 0));
+}
+extern "C" int openat(int directory, const char* path, int flags, ...) {
+  if (brenvik::FailingCall::failsNow("openat")) return -1;
+  return static_cast<int>(::syscall(SYS_openat, directory, path, flags, 0));
+}
 
 namespace brenvik {
 namespace {
@@ -706,6 +727,104 @@ TEST_F(EntitlementFilesTest, OutOfDescriptorsTheQuestionCannotBeAnsweredAndALate
   answer = task->copyEntitlement(kName);
   EXPECT_EQ(answer.value, PropertyList::boolean(false));
   EXPECT_FALSE(answer.error);
+}
+
+TEST_F(EntitlementFilesTest, WhatTheSystemCannotSayNowIsNoNoAndNoLaterFileAnswersInstead) {
+  struct Case {
+    const char* call;
+    int error;
+    int skipped;
+    const char* blamed;
+  };
+  grant("etc/a.plist", "<false/>", quoted("SHA256", std::string(64, '0')));
+  grant("lib/a.plist", "<true/>");
+  auto files = makeFiles();
+  const Child caller(program);
+  const auto task = files.makeTask(caller.token());
+  ASSERT_NE(task, nullptr);
+  for (const Case& which : {Case{"getdents64", EIO, 0, "etc"}, Case{"openat", EMFILE, 0, "etc/a.plist"},
+                            Case{"read", EIO, 0, "etc/a.plist"}, Case{"stat", EIO, 0, "etc/a.plist"},
+                            Case{"stat", ENOMEM, 0, "etc/a.plist"}, Case{"openat", EMFILE, 1, "etc/a.plist"},
+                            Case{"read", EIO, 1, "etc/a.plist"}}) {
+    const FailingCall failing(which.call, which.error, which.skipped);
+    const auto answer = task->copyEntitlement(kName);
+    EXPECT_TRUE(answer.error) << which.call << which.skipped;
+    EXPECT_FALSE(answer.value) << which.call << which.skipped;
+    EXPECT_EQ(failing.failures(), 1) << which.call << which.skipped;
+    expectOneError(line("entitlements cannot be told: ", root / which.blamed, " cannot be examined"));
+  }
+  EXPECT_TRUE(task->copyEntitlement(kName).value) << "the digest is another one, so the second file counts";
+}
+
+TEST_F(EntitlementFilesTest, AFileThatGoesAfterItWasListedIsPassedOverInSilence) {
+  grant("etc/a.plist", "<true/>", quoted("User", "keeper"));
+  grant("etc/b.plist", "<false/>");
+  grant("lib/c.plist", "<true/>");
+  accounts.whenAskedForIds = [&](const std::string&) { fs::remove(root / "etc/b.plist"); };
+  const Child caller(program);
+  expectGranted(caller.token());
+  EXPECT_THAT(log.entries(), IsEmpty());
+}
+
+TEST_F(EntitlementFilesTest, ACallerThatGoesBeforeItIsDigestedHoldsNothing) {
+  write("etc/a.plist", document(quoted("Executable", program) + "<key>Entitlements</key><dict/>"));
+  grant("etc/b.plist", "<true/>", quoted("User", "keeper") + quoted("SHA256", std::string(64, '0')));
+  accounts.accounts["keeper"] = {AccountIds{0, 0}, std::nullopt};
+  auto files = makeFiles();
+  Child caller(program);
+  const auto task = files.makeTask(caller.token());
+  ASSERT_NE(task, nullptr);
+  accounts.whenAskedForIds = [&](const std::string&) { caller.kill(); };
+  const auto answer = task->copyEntitlement(kName);
+  EXPECT_EQ(accounts.idLookUps, 1);
+  EXPECT_FALSE(answer.value);
+  EXPECT_FALSE(answer.error);
+  EXPECT_THAT(log.entries(), IsEmpty());
+}
+
+TEST_F(MadeUpProcessTest, AProgramThatIsNoLongerThereWhenItIsToBeDigestedIsNoMatch) {
+  write("etc/a.plist", document(quoted("Executable", program) + "<key>Entitlements</key><dict/>"));
+  grant("etc/b.plist", "<true/>", quoted("User", "keeper") + quoted("SHA256", std::string(64, '0')));
+  accounts.accounts["keeper"] = {AccountIds{0, 0}, std::nullopt};
+  accounts.whenAskedForIds = [&](const std::string&) { fs::remove(root / "proc/7/exe"); };
+  const auto answer = askHere();
+  EXPECT_EQ(accounts.idLookUps, 1);
+  EXPECT_FALSE(answer.value);
+  EXPECT_FALSE(answer.error);
+}
+
+TEST_F(EntitlementFilesTest, WithoutMemoryTheQuestionCannotBeAnsweredAndALaterFileDoesNotAnswerInstead) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "operator new belongs to the sanitizer";
+  setLogSink(nullptr);  // it needs memory of its own
+  grant("etc/a.plist", "<false/>");
+  grant("lib/a.plist", "<true/>");
+  auto files = makeFiles();
+  const Child caller(program);
+  int withoutTask = 0;
+  int withoutAnswer = 0;
+  for (long first = 0;; ++first) {
+    SecurityTask::Answer answer;
+    bool hasTask = false;
+    {
+      const FailingAllocations noMemory(first);
+      const auto task = files.makeTask(caller.token());
+      hasTask = task != nullptr;
+      if (hasTask) answer = task->copyEntitlement(kName);
+    }
+    if (!hasTask) {
+      ++withoutTask;
+      continue;
+    }
+    if (answer.value) {
+      EXPECT_EQ(answer.value, PropertyList::boolean(false));
+      EXPECT_FALSE(answer.error);
+      break;
+    }
+    EXPECT_TRUE(answer.error) << "allocation " << first;
+    ++withoutAnswer;
+  }
+  EXPECT_GE(withoutTask, 1);
+  EXPECT_GT(withoutAnswer, 5);
 }
 
 TEST_F(EntitlementFilesTest, NoDescriptorIsLeftBehind) {

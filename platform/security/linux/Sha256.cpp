@@ -10,6 +10,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <mutex>
 
 namespace brenvik {
 namespace {
@@ -29,20 +30,22 @@ bool find(void* library, const char* name, Pointer* function) noexcept {
   return *function != nullptr;
 }
 
-// Null without the library. It stays loaded: it registers exit handlers.
+bool load(Crypto* functions) noexcept {
+  void* const library = ::dlopen(kLibrary, RTLD_NOW | RTLD_LOCAL);
+  return library != nullptr && find(library, "SHA256_Init", &functions->init) &&
+         find(library, "SHA256_Update", &functions->update) &&
+         find(library, "SHA256_Final", &functions->final);
+}
+
+// Null without the library, which is looked for again the next time: there may have been no descriptor left
+// to load it with. It stays loaded: it registers exit handlers.
 const Crypto* crypto() noexcept {
-  struct Loaded {
-    Loaded() noexcept {
-      void* const library = ::dlopen(kLibrary, RTLD_NOW | RTLD_LOCAL);
-      isWhole = library != nullptr && find(library, "SHA256_Init", &functions.init) &&
-                find(library, "SHA256_Update", &functions.update) &&
-                find(library, "SHA256_Final", &functions.final);
-    }
-    Crypto functions;
-    bool isWhole = false;
-  };
-  static const Loaded loaded;
-  return loaded.isWhole ? &loaded.functions : nullptr;
+  static std::mutex mutex;
+  static Crypto functions;
+  static bool isLoaded = false;
+  const std::lock_guard lock(mutex);
+  if (!isLoaded) isLoaded = load(&functions);
+  return isLoaded ? &functions : nullptr;
 }
 
 constexpr int digitOf(char c) noexcept {

@@ -5,6 +5,7 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/mman.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <string>
@@ -35,6 +36,22 @@ TEST(Sha256Test, WhatCannotBeReadHasNoDigest) {
   EXPECT_FALSE(sha256OfFile(folder.get()));
 }
 
+TEST(Sha256DeathTest, ALibraryThatCouldNotBeLoadedForWantOfADescriptorIsLoadedTheNextTime) {
+  testing::FLAGS_gtest_death_test_style = "threadsafe";  // a process of its own, which has not loaded it yet
+  EXPECT_EXIT(
+      {
+        const UniqueFd empty(::memfd_create("digest", MFD_CLOEXEC));
+        rlimit before{};
+        ::getrlimit(RLIMIT_NOFILE, &before);
+        const rlimit none{static_cast<rlim_t>(empty.get() + 1), before.rlim_max};
+        ::setrlimit(RLIMIT_NOFILE, &none);
+        const bool withoutDescriptors = sha256OfFile(empty.get()).has_value();
+        ::setrlimit(RLIMIT_NOFILE, &before);
+        ::_exit(!withoutDescriptors && sha256OfFile(empty.get()) == digestOf("") ? 7 : 1);
+      },
+      testing::ExitedWithCode(7), "");
+}
+
 TEST(Sha256Test, HexadecimalDigitsOfEitherCaseMeanTheSame) {
   const std::string lower = "ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad";
   std::string upper = lower;
@@ -52,9 +69,11 @@ TEST(Sha256Test, OtherTextsAreNoDigest) {
   EXPECT_FALSE(parseSha256(good.substr(1)));
   EXPECT_FALSE(parseSha256(good + "0"));
   for (const char wrong : {'g', 'G', '/', ':', '@', '`', ' ', '\0'}) {
-    std::string text = good;
-    text[33] = wrong;
-    EXPECT_FALSE(parseSha256(text)) << wrong;
+    for (const std::size_t place : {32U, 33U}) {  // either half of a byte
+      std::string text = good;
+      text[place] = wrong;
+      EXPECT_FALSE(parseSha256(text)) << wrong;
+    }
   }
 }
 
