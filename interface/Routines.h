@@ -26,9 +26,9 @@ constexpr std::size_t sizeOfReply(ReplyForm form) noexcept {
     case ReplyForm::outOfLine:
       return sizeof(OutOfLineReply);
     case ReplyForm::checkIn:
-      return sizeof(CheckInReply);
+      break;
   }
-  return 0;
+  return sizeof(CheckInReply);
 }
 
 struct RoutineFacts {

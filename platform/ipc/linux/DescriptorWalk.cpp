@@ -65,29 +65,21 @@ std::optional<DescriptorWalk> walkDescriptors(std::span<const std::byte> datagra
   if (inLine) {
     // The message ends where its sender says, or the regions behind it could be read as descriptors.
     end = read<std::uint32_t>(datagram, offsetof(MessageHeader, size));
-    if (end > datagram.size() || end < kDescriptorsOffset || !hasInLineRegion(datagram, end))
-      return std::nullopt;
+    if (end > datagram.size() || !hasInLineRegion(datagram, end)) return std::nullopt;
   }
   walk.messageSize = static_cast<std::uint32_t>(end);
 
   std::size_t regionsEnd = 0;  // of the regions seen so far
   DescriptorCursor cursor(datagram, end);
   while (const auto descriptor = cursor.next()) {
-    switch (descriptor->kind) {
-      case WalkedDescriptor::Kind::port:
-      case WalkedDescriptor::Kind::memfdRegion:
-        ++walk.rights;
-        break;
-      case WalkedDescriptor::Kind::emptyRegion:
-        break;
-      case WalkedDescriptor::Kind::inLineRegion: {
-        const std::size_t start = descriptor->regionOffset;
-        if (regionsEnd == 0 ? start != roundUp8(end) : start < regionsEnd) return std::nullopt;
-        if (start % 8 != 0 || start > datagram.size()) return std::nullopt;
-        if (datagram.size() - start < descriptor->regionLength) return std::nullopt;
-        regionsEnd = start + descriptor->regionLength;
-        break;
-      }
+    if (descriptor->kind == WalkedDescriptor::Kind::inLineRegion) {
+      const std::size_t start = descriptor->regionOffset;
+      if (regionsEnd == 0 ? start != roundUp8(end) : start < regionsEnd) return std::nullopt;
+      if (start % 8 != 0 || start > datagram.size()) return std::nullopt;
+      if (datagram.size() - start < descriptor->regionLength) return std::nullopt;
+      regionsEnd = start + descriptor->regionLength;
+    } else if (descriptor->kind != WalkedDescriptor::Kind::emptyRegion) {
+      ++walk.rights;
     }
   }
   if (inLine && regionsEnd != datagram.size()) return std::nullopt;

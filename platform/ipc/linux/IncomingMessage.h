@@ -50,7 +50,9 @@ class IncomingMessage {
   void release(bool keepRights) noexcept;
 
  private:
-  static constexpr std::size_t kMostRights = 253;  // SCM_MAX_FD: what the kernel lets one message carry
+  // For SCM_MAX_FD rights, which is what the kernel lets one message carry, and its word on the sender.
+  static constexpr std::size_t kControlRoom = CMSG_SPACE(sizeof(int) * 253) + CMSG_SPACE(sizeof(ucred));
+  static constexpr std::size_t kMostRights = (kControlRoom - CMSG_LEN(0)) / sizeof(int);  // that fit in there
 
   struct Mapping {
     void* address;
@@ -70,8 +72,7 @@ class IncomingMessage {
   std::array<PortName, kMostRights> names_;
   // The control data first: it shares the pages of the counts above.
   struct Storage {
-    alignas(
-        cmsghdr) std::array<char, CMSG_SPACE(sizeof(int) * kMostRights) + CMSG_SPACE(sizeof(ucred))> control;
+    alignas(cmsghdr) std::array<char, kControlRoom> control;
     alignas(16) std::array<std::byte, kLargestDatagram> bytes;
   };
   Storage storage_;

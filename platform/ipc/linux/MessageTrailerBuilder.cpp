@@ -30,7 +30,7 @@ std::uint32_t loginUid(pid_t pid) noexcept {
   std::snprintf(path.data(), path.size(), "/proc/%d/loginuid", static_cast<int>(pid));
   const UniqueFd file(::open(path.data(), O_RDONLY | O_CLOEXEC));
   std::array<char, 16> text;
-  const ssize_t size = file.isValid() ? ::read(file.get(), text.data(), text.size()) : -1;
+  const ssize_t size = ::read(file.get(), text.data(), text.size());
   std::uint32_t uid = kNoLoginUid;
   if (size > 0) std::from_chars(text.data(), text.data() + size, uid);
   return uid;
@@ -44,9 +44,9 @@ MessageTrailer buildTrailer(const ucred& sender, std::uint32_t sequence) noexcep
   trailer.sequence = sequence;
   trailer.senderUid = sender.uid;
   trailer.senderGid = sender.gid;
-  const ProcessFacts facts =
-      sender.pid > 0 ? processFacts(sender.pid).value_or(ProcessFacts{}) : ProcessFacts{};
-  const std::array<std::uint32_t, 8> token{sender.pid > 0 ? loginUid(sender.pid) : kNoLoginUid,
+  // A sender of another process namespace has the id 0, of which /proc knows nothing.
+  const ProcessFacts facts = processFacts(sender.pid).value_or(ProcessFacts{});
+  const std::array<std::uint32_t, 8> token{loginUid(sender.pid),
                                            sender.uid,
                                            sender.gid,
                                            sender.uid,

@@ -414,6 +414,7 @@ TEST_F(PortsTest, ARegionThatNoCorrectSenderMakesIsRefused) {
   };
   std::vector<Case> cases;
   cases.push_back({"outside the datagram", inLine(48, 9, 44, 56)});
+  cases.push_back({"beginning behind the datagram's end", inLine(48, 8, 44, 44)});
   cases.push_back({"far outside", inLine(0x4000000000000000, 8, 44, 56)});
   cases.push_back({"wrapping around", inLine(0xFFFFFFFFFFFFFFF8, 0xFFFFFFFF, 44, 56)});
   cases.push_back({"unaligned", inLine(45, 8, 44, 53)});
@@ -421,6 +422,7 @@ TEST_F(PortsTest, ARegionThatNoCorrectSenderMakesIsRefused) {
   cases.push_back({"inside the message", inLine(24, 8, 44, 44)});
   cases.push_back({"the size beyond the datagram", inLine(48, 8, 60, 56)});
   cases.push_back({"the size before the descriptor's end", inLine(40, 8, 40, 48)});
+  cases.push_back({"the size within the header", inLine(24, 8, 20, 44)});
   cases.push_back({"bytes after the last region", inLine(48, 8, 44, 57)});
   cases.push_back(
       {"out of order", complexMessage(kEcho, 2, 60).add(region(72, 8)).add(region(64, 8)).padTo(80)});

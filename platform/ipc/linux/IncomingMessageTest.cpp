@@ -1,0 +1,122 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/ipc/linux/IncomingMessage.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/mman.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cstring>
+
+#include "platform/base/fakes/FailingAllocations.h"
+#include "platform/base/fakes/FailingCalls.h"
+
+extern "C" void* mmap(void* at, std::size_t length, int protection, int flags, int fd,
+                      off_t offset) noexcept {
+  if (brenvik::FailingCall::failsNow("mmap")) return MAP_FAILED;
+  return reinterpret_cast<void*>(::syscall(SYS_mmap, at, length, protection, flags, fd, offset));
+}
+
+namespace brenvik {
+namespace {
+
+using Received = IncomingMessage::Received;
+
+class IncomingMessageTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    std::array<int, 2> ends{};
+    ASSERT_EQ(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()), 0);
+    ours.reset(ends[0]);
+    theirs.reset(ends[1]);
+  }
+
+  // A request with one descriptor, and the file descriptor that it speaks of.
+  template <class Descriptor>
+  void send(const Descriptor& descriptor, int passed) {
+    struct [[gnu::packed]] {
+      MessageHeader header;
+      std::uint32_t count;
+      Descriptor descriptor;
+    } message{{kComplexBit | kReplyDisposition, sizeof message, 77, 0, 0, 1}, 1, descriptor};
+    iovec io{&message, sizeof message};
+    alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof passed)> control{};
+    msghdr raw{};
+    raw.msg_iov = &io;
+    raw.msg_iovlen = 1;
+    raw.msg_control = control.data();
+    raw.msg_controllen = control.size();
+    cmsghdr* const item = CMSG_FIRSTHDR(&raw);
+    item->cmsg_level = SOL_SOCKET;
+    item->cmsg_type = SCM_RIGHTS;
+    item->cmsg_len = CMSG_LEN(sizeof passed);
+    std::memcpy(CMSG_DATA(item), &passed, sizeof passed);
+    ASSERT_EQ(::sendmsg(theirs.get(), &raw, MSG_NOSIGNAL), static_cast<ssize_t>(sizeof message));
+  }
+  static constexpr PortDescriptor kRight{0, 0, 0, kDispositionMoveSend, kPortDescriptorType};
+
+  UniqueFd ours;
+  UniqueFd theirs;
+  SystemPortSpace ports;
+  IncomingMessage incoming{ports};
+};
+
+TEST_F(IncomingMessageTest, AChannelWhosePeerLeftMessagesUnreadHasEnded) {
+  ASSERT_EQ(::send(ours.get(), "unread", 6, MSG_NOSIGNAL), 6);
+  EXPECT_EQ(incoming.receive(ours.get()), Received::nothing);
+  theirs.reset();  // a reset, where a peer that had read everything just ends
+  EXPECT_EQ(incoming.receive(ours.get()), Received::endOfChannel);
+}
+
+TEST_F(IncomingMessageTest, ControlDataThatNobodyKnowsIsPassedOver) {
+  const int on = 1;
+  ASSERT_EQ(::setsockopt(ours.get(), SOL_SOCKET, SO_TIMESTAMP, &on, sizeof on), 0);
+  send(kRight, theirs.get());
+  ASSERT_EQ(incoming.receive(ours.get()), Received::message);
+  EXPECT_TRUE(incoming.unpack(5));
+  EXPECT_EQ(ports.size(), 1U);
+  EXPECT_FALSE(incoming.sender());
+}
+
+TEST_F(IncomingMessageTest, ARegionThatCannotBeMappedRefusesTheMessage) {
+  const UniqueFd memfd(::memfd_create("test", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+  ASSERT_EQ(::write(memfd.get(), "abc", 3), 3);
+  ASSERT_EQ(::fcntl(memfd.get(), F_ADD_SEALS, F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE), 0);
+  const OutOfLineDescriptor region{0, 0, 1, 0, kOutOfLineDescriptorType, 3};
+  send(region, memfd.get());
+  ASSERT_EQ(incoming.receive(ours.get()), Received::message);
+  {
+    const FailingCall noRoom("mmap", ENOMEM);
+    EXPECT_FALSE(incoming.unpack(5));
+    EXPECT_EQ(noRoom.failures(), 1);
+  }
+  send(region, memfd.get());
+  ASSERT_EQ(incoming.receive(ours.get()), Received::message);
+  EXPECT_TRUE(incoming.unpack(5)) << "the next one is served";
+}
+
+TEST_F(IncomingMessageTest, ARightThatThereIsNoMemoryForRefusesTheMessageAndLeavesNothing) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "operator new belongs to the sanitizer";
+  int refused = 0;
+  for (long first = 0;; ++first) {
+    send(kRight, theirs.get());
+    ASSERT_EQ(incoming.receive(ours.get()), Received::message);
+    bool unpacked = false;
+    {
+      const FailingAllocations noMemory(first);
+      unpacked = incoming.unpack(5);
+    }
+    if (unpacked) break;
+    ++refused;
+    EXPECT_EQ(ports.size(), 0U);
+  }
+  EXPECT_GE(refused, 2) << "for the descriptor, and for its name";
+  EXPECT_EQ(ports.size(), 1U);
+  incoming.release(false);
+  EXPECT_EQ(ports.size(), 0U);
+}
+
+}  // namespace
+}  // namespace brenvik
