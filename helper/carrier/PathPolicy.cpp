@@ -5,7 +5,6 @@
 #include <sys/stat.h>
 
 #include <cstring>
-#include <exception>
 #include <string_view>
 
 #include "platform/log/Log.h"
@@ -62,7 +61,7 @@ void PathPolicy::buildTables() {
 bool PathPolicy::isListedCarrierPath(const char* path) noexcept {
   try {
     std::call_once(built_, [this] { buildTables(); });
-  } catch (const std::exception&) {
+  } catch (...) {
     return false;
   }
   struct stat info {};
@@ -80,7 +79,7 @@ bool PathPolicy::isListedCarrierPath(const char* path) noexcept {
 bool PathPolicy::isAllowedCarrierPath(const char* path) noexcept {
   try {
     std::call_once(built_, [this] { buildTables(); });
-  } catch (const std::exception&) {
+  } catch (...) {
     return false;
   }
   const std::string_view compared = comparedPart(path);

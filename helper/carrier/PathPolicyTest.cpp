@@ -11,6 +11,7 @@
 
 #include <atomic>
 #include <functional>
+#include <new>
 #include <string>
 #include <string_view>
 #include <thread>
@@ -247,6 +248,22 @@ TEST(PathPolicyTest, TheHomeIsTakenOnceAndAChangeIsNotSeen) {
   EXPECT_FALSE(policy.isAllowedCarrierPath("/second/Library/Carrier Bundles/a"));
   EXPECT_TRUE(policy.isListedCarrierPath("/first/Library/CarrierDefault.bundle"));
   EXPECT_EQ(asked, 1);
+}
+
+TEST(PathPolicyTest, WithoutMemoryForTheTablesAPathIsRefusedAndTheNextQuestionBuildsThem) {
+  bool exhausted = true;
+  PathPolicy policy([&exhausted] {
+    if (exhausted) throw std::bad_alloc();
+    return MobileAccount{"/home", 0, 0};
+  });
+  RecordingLog log;
+  EXPECT_FALSE(policy.isListedCarrierPath("/home/Library/CarrierDefault.bundle"));
+  EXPECT_FALSE(policy.isAllowedCarrierPath("/home/Library/Carrier Bundles/a"));
+  EXPECT_FALSE(policy.isAllowedCarrierPath("/private/var/mobile/Library/Carrier Bundles/a"));
+  EXPECT_TRUE(log.entries().empty());
+  exhausted = false;
+  EXPECT_TRUE(policy.isListedCarrierPath("/home/Library/CarrierDefault.bundle"));
+  EXPECT_TRUE(policy.isAllowedCarrierPath("/home/Library/Carrier Bundles/a"));
 }
 
 TEST(PathPolicyTest, ConcurrentFirstQuestionsBuildTheTablesOnce) {

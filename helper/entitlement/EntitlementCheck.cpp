@@ -5,7 +5,6 @@
 #include <algorithm>
 #include <map>
 #include <mutex>
-#include <new>
 #include <optional>
 #include <string>
 
@@ -73,8 +72,8 @@ bool EntitlementCheck::HasEntitlement(std::string_view name, const AuditToken& c
   }
   try {
     remember(name, caller);
-  } catch (const std::bad_alloc&) {
-    // Granted all the same; the next question is asked afresh.
+  } catch (...) {
+    // Out of memory: granted all the same; the next question is asked afresh.
   }
   return true;
 }

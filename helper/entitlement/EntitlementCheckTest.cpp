@@ -204,6 +204,40 @@ TEST_F(EntitlementCheckTest, WithoutAWatcherTheGrantIsRememberedAllTheSame) {
   EXPECT_EQ(check.watchers(), 0U) << "the process has an entry already";
 }
 
+TEST_F(EntitlementCheckTest, AnExitThatIsToldTwiceFindsNothingToDoTheSecondTime) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  queues.processExits(7);
+  queues.processExits(7);
+  EXPECT_GE(queues.global().runReady(), 2);
+  EXPECT_EQ(check.grants(), 0U);
+  EXPECT_EQ(check.watchers(), 0U);
+}
+
+// Has no memory for a watcher; nothing else is used.
+class ExhaustedQueues final : public WorkQueues {
+ public:
+  WorkQueue& main() noexcept override { std::abort(); }
+  WorkQueue& global() noexcept override { std::abort(); }
+  std::shared_ptr<WorkQueue> makeSerial(std::string, QualityOfService) override { std::abort(); }
+  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t, std::uint32_t, WorkQueue::Task,
+                                                           WorkQueue::Task) override {
+    throw std::bad_alloc();
+  }
+};
+
+TEST_F(EntitlementCheckTest, WithoutMemoryToRememberItACallerIsGrantedAllTheSameAndAskedForAgain) {
+  ExhaustedQueues exhausted;
+  EntitlementCheck forgetful(security, exhausted);
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(forgetful.HasEntitlement(kName, caller));
+  EXPECT_EQ(forgetful.grants(), 0U);
+  EXPECT_TRUE(forgetful.HasEntitlement(kName, caller));
+  EXPECT_EQ(security.questions(), 2);
+  security.removeProcess(caller);
+  EXPECT_FALSE(forgetful.HasEntitlement(kName, caller));
+}
+
 TEST_F(EntitlementCheckTest, ATokenThatNamesNoProcessIsCheckedUnderMinusOne) {
   const AuditToken nobody = tokenOf(0);
   ASSERT_EQ(nobody.pid(), -1);

@@ -3,7 +3,6 @@
 #include "helper/lasd/LASDUpdater.h"
 
 #include <exception>
-#include <new>
 #include <string_view>
 #include <utility>
 
@@ -46,7 +45,9 @@ class HeldToken {
 };
 
 // For a log line.
-std::string shown(const PropertyList& string) { return string ? std::string(textOf(string)) : "(null)"; }
+std::string shown(const PropertyList& string) {
+  return std::string(string ? textOf(string) : std::string_view("(null)"));
+}
 
 }  // namespace
 
@@ -73,11 +74,11 @@ void LASDUpdater::checkForUpdate(ServerContext& server, std::uint32_t mask) {
       const HeldToken held(server, token);
       try {
         self->check(server, mask);
-      } catch (const std::bad_alloc&) {
+      } catch (...) {  // what is called here throws for no other reason
         logUnified(LogLevel::error, "Update check given up: out of memory");
       }
     });
-  } catch (const std::bad_alloc&) {
+  } catch (...) {
     (void)ReleaseBusyToken(server, token);  // one bit, as it was given: no check will do it
     throw;
   }

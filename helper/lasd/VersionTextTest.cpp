@@ -2,9 +2,20 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "helper/lasd/VersionText.h"
 
+#include <dlfcn.h>
 #include <gtest/gtest.h>
+#include <locale.h>
+#include <unistd.h>
 
 #include <string>
+
+#include "platform/base/fakes/FailingCalls.h"
+
+extern "C" locale_t newlocale(int mask, const char* name, locale_t base) noexcept {
+  if (brenvik::FailingCall::failsNow("newlocale")) return nullptr;
+  const auto real = reinterpret_cast<decltype(&newlocale)>(::dlsym(RTLD_NEXT, "newlocale"));
+  return real(mask, name, base);
+}
 
 namespace brenvik {
 namespace {
@@ -57,6 +68,18 @@ TEST(VersionTextTest, VersionsCompareByTheTable) {
 TEST(VersionTextTest, ANulIsACharacterLikeOthers) {
   EXPECT_FALSE(sameVersion(std::string("1\0a", 3), std::string("1\0b", 3)));
   EXPECT_TRUE(sameVersion(std::string("1\0a", 3), std::string("01\0A", 4)));
+}
+
+TEST(VersionTextDeathTest, WithoutTablesOfOtherLettersThoseCompareAsTheyAreAndAsciiWithoutCase) {
+  testing::FLAGS_gtest_death_test_style = "threadsafe";  // a process of its own, which has no tables yet
+  EXPECT_EXIT(
+      {
+        const FailingCall noTables("newlocale", ENOMEM);
+        const bool holds = sameVersion("ABC", "abc") && sameVersion("\xC3\xA9", "\xC3\xA9") &&
+                           !sameVersion("\xC3\x89", "\xC3\xA9") && noTables.failures() == 1;
+        ::_exit(holds ? 7 : 1);
+      },
+      testing::ExitedWithCode(7), "");
 }
 
 }  // namespace
