@@ -73,7 +73,8 @@ bool IncomingMessage::mapRegion(int fd, std::uint32_t length, std::uint64_t* add
   struct stat status {};
   (void)::fstat(fd, &status);  // a descriptor with seals has a size
   if (status.st_size < static_cast<off_t>(length)) return false;
-  void* const mapped = ::mmap(nullptr, length, PROT_READ, MAP_SHARED, fd, 0);
+  // Private: before Linux 6.7 a shared mapping of memory sealed against writing is refused, even for reading.
+  void* const mapped = ::mmap(nullptr, length, PROT_READ, MAP_PRIVATE, fd, 0);
   if (mapped == MAP_FAILED) return false;
   mappings_[mappingCount_++] = {mapped, length};
   *address = reinterpret_cast<std::uint64_t>(mapped);

@@ -17,6 +17,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <string>
 #include <vector>
 
@@ -389,6 +390,22 @@ TEST_F(PortsTest, RegionsTravelAsSealedMemfds) {
   const std::size_t before = openDescriptors();
   EXPECT_EQ(codeOf(datagram), 1 + 2 + 3 + 4 + 5);
   EXPECT_EQ(openDescriptors(), before);
+}
+
+// What every kernel allows for memory that is sealed against writing: a shared mapping is refused before 6.7.
+TEST_F(PortsTest, ASealedMemfdIsMappedPrivatelyForReading) {
+  const UniqueFd sealed = memfd("\x01");
+  Datagram datagram = complexMessage(kEcho, 1, 44).add(region(0, 1));
+  datagram.fds = {sealed.get()};
+  std::string protection = "not mapped";
+  table.whileServing = [&] {
+    std::ifstream mappings("/proc/self/maps");
+    for (std::string line; std::getline(mappings, line);) {
+      if (line.find("/memfd:test") != std::string::npos) protection = line.substr(line.find(' ') + 1, 4);
+    }
+  };
+  EXPECT_EQ(codeOf(datagram), 1);
+  EXPECT_EQ(protection, "r--p");
 }
 
 TEST_F(PortsTest, BothWaysMayMixAndAnEmptyRegionCarriesNothing) {
