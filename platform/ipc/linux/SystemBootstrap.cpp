@@ -96,11 +96,10 @@ UniqueFd SystemBootstrap::fromServiceManager(const char* serviceName) {
     // More were promised than are open: the rest was never ours.
     if (::fcntl(kFirstListenDescriptor + i, F_SETFD, FD_CLOEXEC) != 0) break;
     UniqueFd descriptor(kFirstListenDescriptor + i);
-    const std::string_view name = names.substr(0, names.find(':'));
+    const std::string name(names.substr(0, names.find(':')));
     names.remove_prefix(std::min(name.size() + 1, names.size()));
     if (name != serviceName || chosen.isValid()) {
-      logUnified(LogLevel::error, "passed over a listening descriptor named \"%.*s\"",
-                 static_cast<int>(name.size()), name.data());
+      logUnified(LogLevel::error, "passed over a listening descriptor named \"%s\"", name.c_str());
     } else if (!isListeningPort(descriptor.get())) {
       logUnified(LogLevel::error, "the descriptor named \"%s\" is no listening SOCK_SEQPACKET socket",
                  serviceName);

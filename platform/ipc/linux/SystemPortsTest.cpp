@@ -18,6 +18,7 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <iostream>
 #include <string>
 #include <vector>
 
@@ -794,12 +795,42 @@ TEST_F(ServiceTest, AFileThatIsNoSocketIsLeftAlone) {
   PortName name = kNullPort;
   EXPECT_EQ(bootstrap().checkIn("service", &name), kern::noAccess);
   EXPECT_TRUE(std::filesystem::is_directory(path()));
+  EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                               LogLevel::error, path() + " is not a socket, and stays as it is")});
 }
 
 TEST_F(ServiceTest, APathTooLongForASocketIsRefused) {
   directory += "/" + std::string(120, 'x');
   PortName name = kNullPort;
   EXPECT_EQ(bootstrap().checkIn("service", &name), kern::noAccess);
+  EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                               LogLevel::error, path() + ": the path is too long for a socket")});
+}
+
+TEST_F(ServiceTest, ALockThatCannotBeTakenIsRefusedAndSaidWhy) {
+  const std::string lock = directory + "/.service.lock";
+  std::filesystem::create_directory(lock);
+  PortName name = kNullPort;
+  EXPECT_EQ(bootstrap().checkIn("service", &name), kern::noAccess);
+  EXPECT_FALSE(std::filesystem::exists(path()));
+  EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                               LogLevel::error, "cannot lock " + lock + ": Is a directory")});
+}
+
+TEST_F(ServiceTest, ASocketThatCannotBeMadeIsSaidWhy) {
+  const std::size_t open = openDescriptors();
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+  const UniqueFd next(::fcntl(client.get(), F_DUPFD_CLOEXEC, 0));
+  // One place is left, and the lock takes it.
+  const rlimit tight{static_cast<rlim_t>(next.get()) + 2, before.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &tight), 0);
+  PortName name = kNullPort;
+  EXPECT_EQ(bootstrap().checkIn("service", &name), kern::noAccess);
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
+  EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                               LogLevel::error, "cannot listen at " + path() + ": Too many open files")});
+  EXPECT_EQ(openDescriptors(), open + 1);
 }
 
 TEST_F(ServiceTest, AnotherInstancesSocketFileIsNotRemovedAtTheEnd) {
@@ -820,6 +851,7 @@ class HandedOverTest : public ServiceTest {
   };
   // Exits with 0 when the bootstrap took descriptor `taken`, with 1 when it made a socket of its own, and
   // with 2 when a descriptor stayed open that should not, or a variable was left to programs started later.
+  // Standard error has what was logged.
   [[noreturn]] void checkIn(const std::vector<Given>& given, const char* names, int taken,
                             int pid = ::getpid(), const char* count = nullptr) {
     ::unlink(path().c_str());
@@ -845,6 +877,7 @@ class HandedOverTest : public ServiceTest {
     if (names != nullptr) ::setenv("LISTEN_FDNAMES", names, 1);
     PortName name = kNullPort;
     if (bootstrap().checkIn("service", &name) != kern::success) ::_exit(3);
+    for (const auto& entry : log.entries()) std::cerr << testing::PrintToString(entry) << '\n';
     for (int fd = 3; fd < end; ++fd) {
       const int flags = ::fcntl(fd, F_GETFD);
       if (pid == ::getpid() && (fd == taken ? flags != FD_CLOEXEC : flags != -1 && !isOurOwn(fd))) ::_exit(2);
@@ -854,6 +887,12 @@ class HandedOverTest : public ServiceTest {
       ::_exit(2);
     }
     ::_exit(std::filesystem::exists(path()) ? 1 : 0);
+  }
+
+  static std::string passedOver(const std::string& name) {
+    return testing::PrintToString(RecordingLog::unifiedLine(
+               LogLevel::error, "passed over a listening descriptor named \"" + name + "\"")) +
+           '\n';
   }
 
  private:
@@ -867,31 +906,40 @@ class HandedOverTest : public ServiceTest {
 };
 
 TEST_F(HandedOverTest, TheListeningDescriptorOfTheServicesNameIsTakenAndTheOthersAreClosed) {
-  EXPECT_EXIT(checkIn({{}}, "service", 3), testing::ExitedWithCode(0), "");
-  EXPECT_EXIT(checkIn({{}, {}, {}}, "other:service:service", 4), testing::ExitedWithCode(0), "");
+  EXPECT_EXIT(checkIn({{}}, "service", 3), testing::ExitedWithCode(0), testing::Eq(""));
+  EXPECT_EXIT(checkIn({{}, {}, {}}, "other:service:service", 4), testing::ExitedWithCode(0),
+              testing::Eq(passedOver("other") + passedOver("service")));
 }
 
 TEST_F(HandedOverTest, WithoutOneOfItsNameTheServiceMakesItsOwnSocket) {
-  EXPECT_EXIT(checkIn({{}}, "servic", -1), testing::ExitedWithCode(1), "");
-  EXPECT_EXIT(checkIn({{}}, "services", -1), testing::ExitedWithCode(1), "");
-  EXPECT_EXIT(checkIn({{}}, nullptr, -1), testing::ExitedWithCode(1), "");
-  EXPECT_EXIT(checkIn({{}, {}}, "other", -1), testing::ExitedWithCode(1), "");
+  for (const char* const name : {"servic", "services", ""}) {
+    EXPECT_EXIT(checkIn({{}}, name, -1), testing::ExitedWithCode(1), testing::Eq(passedOver(name)));
+  }
+  EXPECT_EXIT(checkIn({{}}, nullptr, -1), testing::ExitedWithCode(1), testing::Eq(passedOver("")));
+  EXPECT_EXIT(checkIn({{}, {}}, "other", -1), testing::ExitedWithCode(1),
+              testing::Eq(passedOver("other") + passedOver("")));
 }
 
 TEST_F(HandedOverTest, ADescriptorThatListensNotOrNotForDatagramsInOrderIsNotTaken) {
+  const std::string line =
+      testing::PrintToString(RecordingLog::unifiedLine(
+          LogLevel::error, "the descriptor named \"service\" is no listening SOCK_SEQPACKET socket")) +
+      '\n';
   EXPECT_EXIT(checkIn({{.type = SOCK_SEQPACKET, .listens = false}}, "service", -1),
-              testing::ExitedWithCode(1), "");
-  EXPECT_EXIT(checkIn({{.type = SOCK_STREAM}}, "service", -1), testing::ExitedWithCode(1), "");
+              testing::ExitedWithCode(1), testing::Eq(line));
+  EXPECT_EXIT(checkIn({{.type = SOCK_STREAM}}, "service", -1), testing::ExitedWithCode(1), testing::Eq(line));
 }
 
 TEST_F(HandedOverTest, WhatIsMeantForAnotherProcessIsLeftAlone) {
-  EXPECT_EXIT(checkIn({{}}, "service", 3, ::getppid()), testing::ExitedWithCode(1), "");
+  EXPECT_EXIT(checkIn({{}}, "service", 3, ::getppid()), testing::ExitedWithCode(1), testing::Eq(""));
 }
 
 TEST_F(HandedOverTest, ACountThatIsNoneOrTooLargeEndsAtTheDescriptorsThereAre) {
-  EXPECT_EXIT(checkIn({{}}, "service:", 3, ::getpid(), "2147483647"), testing::ExitedWithCode(0), "");
+  EXPECT_EXIT(checkIn({{}}, "service:", 3, ::getpid(), "2147483647"), testing::ExitedWithCode(0),
+              testing::Eq(""));
   for (const char* const count : {"", "0", "-1", "1x", " 1", "99999999999"}) {
-    EXPECT_EXIT(checkIn({}, "service", -1, ::getpid(), count), testing::ExitedWithCode(1), "") << count;
+    EXPECT_EXIT(checkIn({}, "service", -1, ::getpid(), count), testing::ExitedWithCode(1), testing::Eq(""))
+        << count;
   }
 }
 
@@ -995,6 +1043,8 @@ TEST_F(ServiceTest, RunningOutOfDescriptorsNeitherKillsAcceptNorSpins) {
   }
   pump();  // takes the waiting connection off the queue, unserved
   EXPECT_TRUE(isClosed(waiting));
+  EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                               LogLevel::error, "out of descriptors: a connection was closed unserved")});
   EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::timedOut);
   fillers.clear();
   ::setrlimit(RLIMIT_NOFILE, &old);
