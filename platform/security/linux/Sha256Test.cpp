@@ -36,20 +36,21 @@ TEST(Sha256Test, WhatCannotBeReadHasNoDigest) {
   EXPECT_FALSE(sha256OfFile(folder.get()));
 }
 
+// Exits with 7 when a digest cannot be had without a descriptor to spare and can be had with one.
+[[noreturn]] void digestWithoutAndWithDescriptors() {
+  const UniqueFd empty(::memfd_create("digest", MFD_CLOEXEC));
+  rlimit before{};
+  ::getrlimit(RLIMIT_NOFILE, &before);
+  const rlimit none{0, before.rlim_max};
+  ::setrlimit(RLIMIT_NOFILE, &none);
+  const bool without = sha256OfFile(empty.get()).has_value();
+  ::setrlimit(RLIMIT_NOFILE, &before);
+  ::_exit(!without && sha256OfFile(empty.get()) == digestOf("") ? 7 : 1);
+}
+
 TEST(Sha256DeathTest, ALibraryThatCouldNotBeLoadedForWantOfADescriptorIsLoadedTheNextTime) {
   testing::FLAGS_gtest_death_test_style = "threadsafe";  // a process of its own, which has not loaded it yet
-  EXPECT_EXIT(
-      {
-        const UniqueFd empty(::memfd_create("digest", MFD_CLOEXEC));
-        rlimit before{};
-        ::getrlimit(RLIMIT_NOFILE, &before);
-        const rlimit none{static_cast<rlim_t>(empty.get() + 1), before.rlim_max};
-        ::setrlimit(RLIMIT_NOFILE, &none);
-        const bool withoutDescriptors = sha256OfFile(empty.get()).has_value();
-        ::setrlimit(RLIMIT_NOFILE, &before);
-        ::_exit(!withoutDescriptors && sha256OfFile(empty.get()) == digestOf("") ? 7 : 1);
-      },
-      testing::ExitedWithCode(7), "");
+  EXPECT_EXIT(digestWithoutAndWithDescriptors(), testing::ExitedWithCode(7), "");
 }
 
 TEST(Sha256Test, HexadecimalDigitsOfEitherCaseMeanTheSame) {
