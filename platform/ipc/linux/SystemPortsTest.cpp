@@ -823,7 +823,9 @@ TEST_F(ServiceTest, ASocketThatCannotBeMadeIsSaidWhy) {
   ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
   const UniqueFd next(::fcntl(client.get(), F_DUPFD_CLOEXEC, 0));
   // One place is left, and the lock takes it.
-  const rlimit tight{static_cast<rlim_t>(next.get()) + 2, before.rlim_max};
+  UniqueFd place(::fcntl(client.get(), F_DUPFD_CLOEXEC, 0));
+  const rlimit tight{static_cast<rlim_t>(place.get()) + 1, before.rlim_max};
+  place.reset();
   ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &tight), 0);
   PortName name = kNullPort;
   EXPECT_EQ(bootstrap().checkIn("service", &name), kern::noAccess);
