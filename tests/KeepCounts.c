@@ -3,8 +3,10 @@
 //
 // Linked into the programs of a coverage build, and into no other: gcov writes its counts when a program
 // leaves by exit(), which forked children of tests and a daemon that is told to stop do not.
+#define _GNU_SOURCE
 #include <signal.h>
 #include <stddef.h>
+#include <unistd.h>
 
 void __gcov_dump(void);
 _Noreturn void __real__exit(int status);
@@ -21,6 +23,9 @@ static void onEnd(int signal) {
   __gcov_dump();
   (void)raise(signal);  // ends the process as ever: the handler was for one time
 }
+
+// Runs before gcov's own: a test may have left the program without a descriptor to write with.
+__attribute__((destructor)) static void freeDescriptors(void) { closefrom(STDERR_FILENO + 1); }
 
 __attribute__((constructor)) static void keepCounts(void) {
   static const int kSignals[] = {SIGTERM, SIGABRT};
