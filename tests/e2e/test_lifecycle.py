@@ -12,7 +12,7 @@ import time
 import unittest
 
 import wire
-from harness import (ERROR, SOCKET, Daemon, HelperTest, Logs, as_account, entitle, eventually,
+from harness import (DAEMON, ERROR, SOCKET, Daemon, HelperTest, Logs, as_account, entitle, eventually,
                      listen, main)
 
 IDLE = 10.0  # seconds
@@ -30,6 +30,19 @@ class StandingAlone(HelperTest):
         self.logs.wait_for("unified", ERROR, "unable to create server objects - out of resources")
         self.logs.wait_for("unified", ERROR, "unable to startup BrenvikMobileHelper server")
         self.client()  # the first is not disturbed
+
+    def test_without_descriptors_to_start_with_it_says_so_and_exits_with_1(self):
+        self.daemon.stop()
+        for limit in (4, 5, 6):  # no loop; no lock on the folder; no socket to listen at
+            self.logs.clear()
+            starved = subprocess.run(["/bin/sh", "-c", f'ulimit -n {limit}; exec "$0"', str(DAEMON)],
+                                     stdin=subprocess.DEVNULL, stderr=subprocess.PIPE, timeout=20)
+            self.assertEqual(starved.returncode, 1, limit)
+            line = "unable to startup BrenvikMobileHelper server"
+            if f"<3>{line}" not in starved.stderr.decode().splitlines():  # there may be one left for the journal
+                self.logs.wait_for("unified", ERROR, line)
+        self.daemon = Daemon()
+        self.client()
 
     def test_a_killed_instance_leaves_a_stale_file_that_the_next_replaces(self):
         self.daemon.process.kill()

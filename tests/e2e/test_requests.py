@@ -197,6 +197,18 @@ class RadioLogs(HelperTest):
             self.assertEqual(client.status("EnableRadioManagerLogs", struct.pack("<i", value)), 0)
             self.logs.wait_for("bsd", LOG_ERR, f"Enabling wireless radio manager logs: {value}")
 
+    def test_where_syslog_ends_in_the_journal_its_lines_go_there_with_their_facility(self):
+        os.unlink(self.logs.SYSLOG)
+        os.symlink("/run/systemd/journal/dev-log", self.logs.SYSLOG)
+        self.assertEqual(self.client().status("EnableRadioManagerLogs", struct.pack("<i", 1)), 0)
+        line = "Enabling wireless radio manager logs: 1"
+        self.logs.wait_for("unified", LOG_ERR, line)
+        entry, = [entry for entry in self.logs.entries if entry["MESSAGE"] == line]
+        self.assertEqual(entry["SYSLOG_FACILITY"], "3")
+        self.assertEqual(entry["SYSLOG_IDENTIFIER"], "BrenvikMobileHelper")
+        self.assertRegex(entry["MESSAGE_ID"], r"\A[0-9a-f]{32}\Z")
+        self.assertNotIn("CODE_FILE", entry)
+
 
 class Bombs(HelperTest):
     def test_deep_and_exploding_property_lists_get_5_at_once_in_bounded_memory(self):

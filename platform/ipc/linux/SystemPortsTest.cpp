@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <sys/file.h>
 #include <sys/mman.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
@@ -14,12 +15,14 @@
 
 #include <algorithm>
 #include <array>
+#include <chrono>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <iostream>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/ipc/linux/MessageTrailerBuilder.h"
@@ -788,6 +791,30 @@ TEST_F(ServiceTest, ANameThatALiveProcessHoldsIsRefusedAndSaidWhy) {
   EXPECT_EQ(log.entries().back(),
             RecordingLog::unifiedLine(LogLevel::error, "another process already serves " + path()));
   EXPECT_TRUE(connect().isValid()) << "the first is not disturbed";
+}
+
+TEST_F(ServiceTest, WhoeverStartsAtTheSameTimeWaitsForTheOtherToBeDone) {
+  const UniqueFd lock(::open((directory + "/.service.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+  ASSERT_EQ(::flock(lock.get(), LOCK_EX), 0);
+  std::thread other([&lock] {
+    std::this_thread::sleep_for(30ms);
+    ::flock(lock.get(), LOCK_UN);
+  });
+  const auto started = std::chrono::steady_clock::now();
+  listen();
+  other.join();
+  EXPECT_GE(std::chrono::steady_clock::now() - started, 30ms);
+  EXPECT_TRUE(connect().isValid());
+}
+
+TEST_F(ServiceTest, AFolderThatCannotBeMadeIsSaid) {
+  ASSERT_TRUE(UniqueFd(::creat((directory + "/file").c_str(), 0600)).isValid());
+  directory += "/file/below";
+  PortName name = kNullPort;
+  EXPECT_EQ(bootstrap().checkIn("service", &name), kern::noAccess);
+  EXPECT_EQ(log.entries().back(),
+            RecordingLog::unifiedLine(LogLevel::error,
+                                      "cannot lock " + directory + "/.service.lock: Not a directory"));
 }
 
 TEST_F(ServiceTest, AFileThatIsNoSocketIsLeftAlone) {
