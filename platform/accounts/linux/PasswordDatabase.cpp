@@ -6,7 +6,6 @@
 
 #include <array>
 #include <cerrno>
-#include <new>
 #include <vector>
 
 namespace brenvik {
@@ -27,7 +26,6 @@ bool withEntry(const char* name, const Use& use) {
     passwd entry{};
     passwd* found = nullptr;
     const int error = ::getpwnam_r(name, &entry, text, size, &found);
-    if (error == EINTR) continue;
     if (error == ERANGE && size < kLargestEntry) {
       larger.resize(size * 4);
       text = larger.data();
@@ -46,8 +44,8 @@ std::optional<AccountIds> PasswordDatabase::idsOf(const char* name) noexcept try
   std::optional<AccountIds> ids;
   withEntry(name, [&ids](const passwd& entry) { ids = AccountIds{entry.pw_uid, entry.pw_gid}; });
   return ids;
-} catch (const std::bad_alloc&) {
-  return std::nullopt;
+} catch (...) {
+  return std::nullopt;  // out of memory
 }
 
 std::optional<std::string> PasswordDatabase::homeDirectoryOf(const char* name) noexcept try {
@@ -56,8 +54,8 @@ std::optional<std::string> PasswordDatabase::homeDirectoryOf(const char* name) n
     if (entry.pw_dir != nullptr && *entry.pw_dir != '\0') home = entry.pw_dir;
   });
   return home;
-} catch (const std::bad_alloc&) {
-  return std::nullopt;
+} catch (...) {
+  return std::nullopt;  // out of memory
 }
 
 }  // namespace brenvik
