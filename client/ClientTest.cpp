@@ -18,6 +18,7 @@
 #include <cstring>
 #include <functional>
 #include <memory>
+#include <set>
 #include <string>
 #include <thread>
 #include <vector>
@@ -849,9 +850,38 @@ TEST(ClientTest, NothingStaysOpenAndEverythingIsCloseOnExec) {
   EXPECT_EQ(openDescriptors(), before);
 }
 
-TEST(ClientTest, EveryCodeHasAText) {
+TEST(ClientTest, EveryCodeHasATextOfItsOwn) {
+  std::set<std::string> texts;
   for (std::int32_t code = BVMH_ERROR_FIRST; code <= BVMH_ERROR_LAST; ++code) {
     EXPECT_STRNE(bvmh_error_text(code), "");
+  }
+  const std::array named{BVMH_OK,
+                         BVMH_NO_SPACE,
+                         BVMH_FAILURE,
+                         BVMH_RESOURCE_SHORTAGE,
+                         BVMH_NO_ACCESS,
+                         BVMH_MEMORY_FAILURE,
+                         BVMH_INVALID_SECURITY,
+                         BVMH_NOT_SUPPORTED,
+                         BVMH_TYPE_ERROR,
+                         BVMH_BAD_ID,
+                         BVMH_BAD_ARGUMENTS,
+                         BVMH_TRAILER_ERROR,
+                         BVMH_ERROR_INVALID_ARGUMENT,
+                         BVMH_ERROR_NO_MEMORY,
+                         BVMH_ERROR_NOT_CONNECTED,
+                         BVMH_ERROR_UNREACHABLE,
+                         BVMH_ERROR_TIMED_OUT,
+                         BVMH_ERROR_HELPER_GONE,
+                         BVMH_ERROR_ANSWER_LOST,
+                         BVMH_ERROR_PROTOCOL,
+                         BVMH_ERROR_SYSTEM,
+                         BVMH_ERROR_NAME_IN_USE,
+                         BVMH_ERROR_NO_LONGER_THERE};
+  for (const std::int32_t code : named) {
+    const std::string text = bvmh_error_text(code);
+    EXPECT_TRUE(texts.insert(text).second) << text;
+    EXPECT_FALSE(text.starts_with("unknown") || text.ends_with("a code of its system")) << code;
   }
   EXPECT_STREQ(bvmh_error_text(BVMH_OK), "success");
   EXPECT_STREQ(bvmh_error_text(BVMH_INVALID_SECURITY),

@@ -35,15 +35,11 @@ Message readAs(std::span<const std::byte> datagram) noexcept {
   return message;
 }
 
-// False with errno set. What is there already stays as it is.
+// False with errno set. What is there already stays as it is. Precondition: a socket's path can begin so.
 bool makeDirectories(const char* path) noexcept {
-  char copy[sizeof(sockaddr_un::sun_path)];
-  const std::size_t length = ::strnlen(path, sizeof copy);
-  if (length == sizeof copy) {
-    errno = ENAMETOOLONG;
-    return false;
-  }
-  std::memcpy(copy, path, length + 1);
+  char copy[sizeof(sockaddr_un::sun_path)] = {};
+  const std::size_t length = ::strnlen(path, sizeof copy - 1);
+  std::memcpy(copy, path, length);
   for (std::size_t i = 1; i <= length; ++i) {
     if (copy[i] != '/' && copy[i] != '\0') continue;
     const char ended = std::exchange(copy[i], '\0');

@@ -1,7 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -286,6 +288,31 @@ TEST_F(ListenerTest, ServesOnlyTheServicesAskedFor) {
   EXPECT_EQ(bvmh_listener_create(directory_.path().c_str(), 4, &none), BVMH_ERROR_INVALID_ARGUMENT);
   EXPECT_EQ(bvmh_listener_create((directory_.path() + std::string(100, 'x')).c_str(), 1, &none),
             BVMH_ERROR_INVALID_ARGUMENT);
+}
+
+TEST_F(ListenerTest, OutOfDescriptorsAConnectionWaitsAndTheReasonIsTold) {
+  listen();
+  const UniqueFd helper = connect(kNotifications);
+  send(helper, Bytes(24).append("late"));
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+  const rlimit none{0, before.rlim_max};  // what is open stays open
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &none), 0);
+  const std::int32_t code = bvmh_listener_next(listener_.get(), kPlenty, &event_);
+  const int reason = bvmh_listener_errno(listener_.get());
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
+  EXPECT_EQ(code, BVMH_ERROR_SYSTEM);
+  EXPECT_EQ(reason, EMFILE);
+  EXPECT_EQ(next(BVMH_EVENT_NOTIFICATION), "late");
+}
+
+TEST_F(ListenerTest, AFolderThatCannotBeMadeIsTold) {
+  const std::string file = directory_.path() + "/file";
+  ASSERT_TRUE(UniqueFd(::creat(file.c_str(), 0600)).isValid());
+  bvmh_listener* none = nullptr;
+  EXPECT_EQ(bvmh_listener_create((file + "/below").c_str(), BVMH_PUSHES, &none), BVMH_ERROR_SYSTEM);
+  EXPECT_EQ(errno, ENOTDIR);
+  EXPECT_EQ(none, nullptr);
 }
 
 TEST_F(ListenerTest, ALiveNameIsLeftAloneAndAStaleOneReplaced) {

@@ -2,8 +2,6 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/plist/PropertyListCodec.h"
 
-#include <new>
-#include <stdexcept>
 #include <string_view>
 
 #include "platform/plist/BinaryReader.h"
@@ -18,9 +16,7 @@ PropertyList parsePropertyList(std::span<const std::byte> bytes) noexcept {
   const std::string_view text(reinterpret_cast<const char*>(bytes.data()), bytes.size());
   try {
     return text.starts_with("bplist") ? plist::readBinary(text) : plist::readXml(text);
-  } catch (const std::bad_alloc&) {
-    return {};
-  } catch (const std::length_error&) {  // of a string or a vector: no memory would have sufficed
+  } catch (...) {  // out of memory, or of what a string or a vector can hold
     return {};
   }
 }
@@ -31,9 +27,7 @@ std::optional<std::string> serializePropertyList(const PropertyList& value,
   try {
     const plist::Node& root = plist::Access::node(value);
     return format == PropertyListFormat::xml ? plist::writeXml(root) : plist::writeBinary(root);
-  } catch (const std::bad_alloc&) {
-    return std::nullopt;
-  } catch (const std::length_error&) {
+  } catch (...) {
     return std::nullopt;
   }
 }

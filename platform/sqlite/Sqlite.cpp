@@ -21,10 +21,8 @@ bool load(SqliteFunctions* functions) noexcept {
   void* const library = ::dlopen(kLibrary, RTLD_NOW | RTLD_LOCAL);
   if (library == nullptr) return false;
 #define BRENVIK_SQLITE_LOOK(name) &&look(library, "sqlite3_" #name, &functions->name)
-  if (true BRENVIK_SQLITE_FUNCTIONS(BRENVIK_SQLITE_LOOK)) return true;
+  return true BRENVIK_SQLITE_FUNCTIONS(BRENVIK_SQLITE_LOOK);
 #undef BRENVIK_SQLITE_LOOK
-  ::dlclose(library);
-  return false;
 }
 
 }  // namespace

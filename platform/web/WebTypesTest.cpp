@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <map>
 #include <set>
 
 namespace brenvik {
@@ -46,10 +47,36 @@ TEST(WebTypesTest, AWrongClockIsSaidInWords) {
 }
 
 TEST(WebTypesTest, StatusCodesHaveTheirNamesAndUnlistedOnesTheirClass) {
-  EXPECT_STREQ(textOfStatusCode(200), "OK");
-  EXPECT_STREQ(textOfStatusCode(304), "Not Modified");
-  EXPECT_STREQ(textOfStatusCode(404), "Not Found");
-  EXPECT_STREQ(textOfStatusCode(0), "no status");
+  // The reason phrases of RFC 9110 section 15, and of RFC 6585 and RFC 7725.
+  const std::map<int, const char*> named{{0, "no status"},
+                                         {200, "OK"},
+                                         {201, "Created"},
+                                         {202, "Accepted"},
+                                         {204, "No Content"},
+                                         {206, "Partial Content"},
+                                         {301, "Moved Permanently"},
+                                         {302, "Found"},
+                                         {303, "See Other"},
+                                         {304, "Not Modified"},
+                                         {307, "Temporary Redirect"},
+                                         {308, "Permanent Redirect"},
+                                         {400, "Bad Request"},
+                                         {401, "Unauthorized"},
+                                         {403, "Forbidden"},
+                                         {404, "Not Found"},
+                                         {405, "Method Not Allowed"},
+                                         {406, "Not Acceptable"},
+                                         {408, "Request Timeout"},
+                                         {410, "Gone"},
+                                         {416, "Range Not Satisfiable"},
+                                         {429, "Too Many Requests"},
+                                         {451, "Unavailable For Legal Reasons"},
+                                         {500, "Internal Server Error"},
+                                         {501, "Not Implemented"},
+                                         {502, "Bad Gateway"},
+                                         {503, "Service Unavailable"},
+                                         {504, "Gateway Timeout"}};
+  for (const auto& [code, text] : named) EXPECT_STREQ(textOfStatusCode(code), text) << code;
   EXPECT_STREQ(textOfStatusCode(102), "Informational");
   EXPECT_STREQ(textOfStatusCode(226), "Successful");
   EXPECT_STREQ(textOfStatusCode(399), "Redirection");
