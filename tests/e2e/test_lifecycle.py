@@ -210,13 +210,11 @@ class Activated(HelperTest):
             self.assertNotIn(library, loaded)
 
 
-LIVES = []
-
-
 def check_in():
-    """A check-in whose port lives as long as this module."""
+    """A check-in whose port lives as long as this module's tests."""
     ours, theirs = socket.socketpair(socket.AF_UNIX, socket.SOCK_SEQPACKET)
-    LIVES.extend((ours, theirs))
+    unittest.addModuleCleanup(ours.close)
+    unittest.addModuleCleanup(theirs.close)
     return wire.check_in_message(), [theirs.fileno()]
 
 

@@ -209,6 +209,16 @@ TEST_F(FilePreferencesTest, WhatStandsInAFileOfOursIsNotWrittenAgainAndInAForeig
   EXPECT_TRUE(calls.trace.empty());
 }
 
+TEST_F(FilePreferencesTest, AValueTooDeepToBeReadAgainIsNotStoredAndSaidSoAndTheOthersAre) {
+  PropertyList deep = PropertyList::integer(1);
+  for (std::size_t level = 0; level < kDeepestPropertyList; ++level) deep = PropertyList::array({deep});
+  set(*ours, "good", "stored");
+  ours->setValue("deep", deep, kDomain, kUser, kHost);
+  EXPECT_FALSE(sync(*ours));
+  EXPECT_EQ(onlyLine(), line("a value is too deep or too large to be stored"));
+  EXPECT_EQ(onDisk(), textDictionary("good", "stored"));
+}
+
 TEST_F(FilePreferencesTest, AShortWriteIsContinued) {
   SystemCalls calls;
   calls.writeLimit = 7;
