@@ -9,7 +9,6 @@
 #include <unistd.h>
 
 #include <array>
-#include <cstring>
 
 #include "BareServer.h"
 
@@ -22,19 +21,7 @@ int main() {
       ::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()) != 0) {
     return 1;
   }
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
-  iovec io{bytes.data(), kBareCheckInReply};
-  msghdr message{};
-  message.msg_iov = &io;
-  message.msg_iovlen = 1;
-  message.msg_control = control.data();
-  message.msg_controllen = control.size();
-  cmsghdr* const item = CMSG_FIRSTHDR(&message);
-  item->cmsg_level = SOL_SOCKET;
-  item->cmsg_type = SCM_RIGHTS;
-  item->cmsg_len = CMSG_LEN(sizeof(int));
-  std::memcpy(CMSG_DATA(item), &ends[1], sizeof(int));
-  if (::sendmsg(connection, &message, MSG_NOSIGNAL) < 0) return 1;
+  if (!sendWithDescriptor(connection, bytes.data(), kBareCheckInReply, ends[1])) return 1;
   ::close(ends[1]);
   ::close(connection);
   for (;;) {

@@ -153,20 +153,7 @@ class ServedProgram {
     request.descriptorCount = 1;
     request.clientPort.disposition = kDispositionMoveSend;
     request.clientPort.type = kPortDescriptorType;
-    alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
-    iovec io{&request, sizeof request};
-    msghdr message{};
-    message.msg_iov = &io;
-    message.msg_iovlen = 1;
-    message.msg_control = control.data();
-    message.msg_controllen = control.size();
-    cmsghdr* const item = CMSG_FIRSTHDR(&message);
-    item->cmsg_level = SOL_SOCKET;
-    item->cmsg_type = SCM_RIGHTS;
-    item->cmsg_len = CMSG_LEN(sizeof(int));
-    const int fd = life.get();
-    std::memcpy(CMSG_DATA(item), &fd, sizeof fd);
-    require(::sendmsg(service, &message, MSG_NOSIGNAL) == sizeof request, "sendmsg");
+    require(sendWithDescriptor(service, &request, sizeof request, life.get()), "sendmsg");
   }
   static UniqueFd receiveCheckInReply(int service) {
     std::array<char, 64> bytes{};

@@ -19,6 +19,7 @@
 #include <vector>
 
 #include "helper/carrier/CarrierOperations.h"
+#include "helper/carrier/CarrierTestSupport.h"
 #include "helper/carrier/FileSystemManager.h"
 #include "platform/files/fakes/ChildProcesses.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
@@ -30,29 +31,7 @@
 namespace brenvik {
 namespace {
 
-constexpr PortName kPort = 77;
 constexpr std::uint8_t kUnwritten = 7;
-
-template <std::size_t size>
-struct Field : std::array<char, size> {
-  explicit Field(std::string_view text) : std::array<char, size>{} { text.copy(this->data(), size); }
-};
-using Long = Field<1024>;
-using Short = Field<256>;
-
-class NoPreferences final : public PreferencesStore {
- public:
-  int flushes = 0;
-  void setValue(std::string_view, const PropertyList&, std::string_view, UserScope,
-                HostScope) noexcept override {}
-  bool synchronize(std::string_view, UserScope, HostScope) noexcept override { return true; }
-  PropertyList copyValue(std::string_view, std::string_view, UserScope, HostScope) noexcept override {
-    return {};
-  }
-  bool synchronizeApplication(std::string_view) noexcept override { return true; }
-  PropertyList copyApplicationValue(std::string_view, std::string_view) noexcept override { return {}; }
-  void flushCachesForAnyUser(const std::string*) noexcept override { ++flushes; }
-};
 
 // The seven requests of an account at `home`, as plain functions.
 class Requests {
@@ -92,14 +71,14 @@ class Requests {
     (void)operations_.unpackArchive(kPort, Short(archive).data(), Short(to).data(), &success);
     return success;
   }
-  int flushes() const { return preferences_.flushes; }
+  std::size_t flushes() const { return preferences_.flushed.size(); }
 
  private:
   const std::string home_;
   const uid_t uid_;
   const gid_t gid_;
   LinuxFileManager files_;
-  NoPreferences preferences_;
+  FlushRecorder preferences_;
   const MobileAccountSource account_ = [this] { return MobileAccount{home_.c_str(), uid_, gid_}; };
   PathPolicy policy_{account_};
   CarrierOperations operations_{FileSystemManager::factory(files_),
@@ -200,7 +179,7 @@ TEST_F(CarrierFaultsTest, OnAFullDiskEveryRoutineLeavesWhatWasThere) {
     EXPECT_EQ(requests.createLink("new", library + "/link"), 5);
     EXPECT_EQ(requests.createLink("new", library + "/fresh"), 5);
     EXPECT_EQ(requests.replaceLink("new", library + "/Carrier Bundle.bundle"), 5);
-    EXPECT_EQ(requests.flushes(), 0);
+    EXPECT_EQ(requests.flushes(), 0U);
     EXPECT_EQ(requests.copyFile(work + "/New.bundle", library + "/Carrier Bundles", "Info.plist"), 0);
     // Replacing what is there goes wrong unnoticed, and the old file is given to the account.
     EXPECT_EQ(requests.copyFile(work, library + "/Carrier Bundles", "carrier.plist"), 1);

@@ -15,6 +15,7 @@
 #include <string>
 #include <vector>
 
+#include "helper/carrier/CarrierTestSupport.h"
 #include "helper/carrier/FileSystemManager.h"
 #include "platform/files/fakes/FaultyFileManager.h"
 #include "platform/files/fakes/ScriptedArchiveCopier.h"
@@ -26,33 +27,6 @@ namespace brenvik {
 namespace {
 
 using Log = RecordingLog;
-constexpr PortName kPort = 77;
-
-// A request field: NUL-padded, and full of letters behind its last byte when a test leaves it unterminated.
-template <std::size_t size>
-struct Field : std::array<char, size> {
-  explicit Field(std::string_view text) : std::array<char, size>{} { text.copy(this->data(), size); }
-};
-using Long = Field<1024>;
-using Short = Field<256>;
-
-// Notes which domains were flushed.
-class FlushRecorder final : public PreferencesStore {
- public:
-  std::vector<std::optional<std::string>> flushed;
-
-  void setValue(std::string_view, const PropertyList&, std::string_view, UserScope,
-                HostScope) noexcept override {}
-  bool synchronize(std::string_view, UserScope, HostScope) noexcept override { return true; }
-  PropertyList copyValue(std::string_view, std::string_view, UserScope, HostScope) noexcept override {
-    return {};
-  }
-  bool synchronizeApplication(std::string_view) noexcept override { return true; }
-  PropertyList copyApplicationValue(std::string_view, std::string_view) noexcept override { return {}; }
-  void flushCachesForAnyUser(const std::string* domain) noexcept override {
-    flushed.push_back(domain == nullptr ? std::nullopt : std::optional(*domain));
-  }
-};
 
 class CarrierOperationsTest : public testing::Test {
  protected:

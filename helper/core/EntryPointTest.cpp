@@ -14,12 +14,6 @@ namespace {
 
 using namespace std::chrono_literals;
 
-class NoRoutines final : public RoutineTable {
- public:
-  Handler find(std::int32_t) const noexcept override { return nullptr; }
-  void* context() const noexcept override { return nullptr; }
-};
-
 class EntryPointTest : public testing::Test {
  protected:
   // A client checks in and dies, then time passes until the server stops.

@@ -20,12 +20,6 @@ namespace {
 
 using namespace std::chrono_literals;
 
-class NoRoutines final : public RoutineTable {
- public:
-  Handler find(std::int32_t) const noexcept override { return nullptr; }
-  void* context() const noexcept override { return nullptr; }
-};
-
 std::uint16_t ourIdentifier() { return static_cast<std::uint16_t>(::getpid() & 0xFFFF); }
 
 std::vector<std::byte> echoReply(std::uint16_t identifier) {

@@ -21,12 +21,6 @@ const std::string kManifest = "https://server.example/1/v3/lasd.plist";
 constexpr std::uint32_t kAll = 31;
 using Entries = std::vector<std::pair<std::string, PropertyList>>;
 
-class NoRoutines final : public RoutineTable {
- public:
-  Handler find(std::int32_t) const noexcept override { return nullptr; }
-  void* context() const noexcept override { return nullptr; }
-};
-
 PropertyList record(const char* version, const std::string& url) {
   return PropertyList::dictionary(
       {{"Version", PropertyList::string(version)}, {"ContentURL", PropertyList::string(url)}});

@@ -227,6 +227,21 @@ def as_account(name, work):
     return os.waitstatus_to_exitcode(os.waitpid(pid, 0)[1])
 
 
+def refused_with():
+    """Checks in; the code of the refusal, 0 for none."""
+    try:
+        wire.Client().close()
+        return 0
+    except wire.Status as status:
+        return status.code
+
+
+def in_a_new_process(program=sys.executable):
+    """The same from a process of its own: a grant is kept for the life of a process."""
+    code = "import sys; sys.path.insert(0, '.'); import harness; sys.exit(harness.refused_with())"
+    return subprocess.run([program, "-c", code], check=False).returncode
+
+
 def eventually(condition, timeout=10, what="the condition"):
     """Waits until condition() is true."""
     end = time.monotonic() + timeout

@@ -6,14 +6,12 @@ import pathlib
 import plistlib
 import resource
 import socket
-import subprocess
-import sys
 import time
 import unittest
 
 import wire
 from harness import (DAEMON, ERROR, SOCKET, Daemon, HelperTest, Logs, as_account, entitle, eventually,
-                     listen, main)
+                     in_a_new_process, listen, main, refused_with)
 
 IDLE = 10.0  # seconds
 
@@ -114,14 +112,6 @@ class StandingAlone(HelperTest):
         self.assertEqual(plistlib.loads(client.copy_preference("com.example.limit", "key")), "small")
 
 
-def refused_with():
-    try:
-        wire.Client().close()
-        return 0
-    except wire.Status as status:
-        return status.code
-
-
 class Admission(HelperTest):
     def test_an_entitled_caller_is_admitted_and_another_account_is_refused_with_35(self):
         self.client()
@@ -151,11 +141,9 @@ class Admission(HelperTest):
         path.unlink()
         second = wire.Client()
         self.addCleanup(second.close)
-        child = "import sys; sys.path.insert(0, '.'); import test_lifecycle; sys.exit(test_lifecycle.refused_with())"
-        command = [sys.executable, "-c", child]
-        self.assertEqual(subprocess.run(command, check=False).returncode, 35)
+        self.assertEqual(in_a_new_process(), 35)
         entitle()
-        self.assertEqual(subprocess.run(command, check=False).returncode, 0)
+        self.assertEqual(in_a_new_process(), 0)
 
     def test_the_caller_whose_port_is_already_dead_gets_5(self):
         ours, theirs = socket.socketpair(socket.AF_UNIX, socket.SOCK_SEQPACKET)

@@ -7,30 +7,16 @@ import pathlib
 import plistlib
 import shutil
 import socket
-import subprocess
 import sys
 import time
 
 import wire
-from harness import ALLOW, BUILD, ENTITLEMENTS, ERROR, LOG_ERR, Daemon, HelperTest, as_account, entitle, main
+from harness import (ALLOW, BUILD, ENTITLEMENTS, ERROR, LOG_ERR, Daemon, HelperTest, as_account, entitle,
+                     in_a_new_process, main, refused_with)
 
 SYSTEM_BUS = pathlib.Path("/run/dbus/system_bus_socket")
 HOSTED = "libbrenvik-baseband-helper.so.0"
 TICK = 10.0  # seconds
-
-
-def refused_with():
-    try:
-        wire.Client().close()
-        return 0
-    except wire.Status as status:
-        return status.code
-
-
-def in_a_new_process(program=sys.executable):
-    """Checks in from a process of its own (a grant is kept for the life of a process); 0 or the refusal."""
-    code = "import sys; sys.path.insert(0, '.'); import test_security; sys.exit(test_security.refused_with())"
-    return subprocess.run([program, "-c", code], check=False).returncode
 
 
 class EntitlementFiles(HelperTest):

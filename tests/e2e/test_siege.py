@@ -260,12 +260,14 @@ class Reporter:
         read, write = os.pipe()
         self.pid = os.fork()
         if self.pid == 0:
-            os.close(read)
-
             def run():
                 work(lambda value: os.write(write, (json.dumps(value) + "\n").encode()))
                 return 0
-            os._exit(as_account(account, run))
+            try:
+                os.close(read)
+                os._exit(as_account(account, run))
+            finally:
+                os._exit(255)  # whatever happened, this process is not the test's
         os.close(write)
         self.report = os.fdopen(read, "r", encoding="utf-8")
 
@@ -273,7 +275,9 @@ class Reporter:
         """All of them, once the process has ended."""
         with self.report:
             values = [json.loads(line) for line in self.report]
-        os.waitpid(self.pid, 0)
+        status = os.waitstatus_to_exitcode(os.waitpid(self.pid, 0)[1])
+        if status != 0:
+            raise AssertionError(f"a process of the siege ended with {status} and said {values}")
         return values
 
 

@@ -16,12 +16,6 @@ namespace {
 
 using namespace std::chrono_literals;
 
-class NoRoutines final : public RoutineTable {
- public:
-  Handler find(std::int32_t) const noexcept override { return nullptr; }
-  void* context() const noexcept override { return nullptr; }
-};
-
 class ServerTest : public testing::Test {
  protected:
   ~ServerTest() override { DestroyServer(server); }

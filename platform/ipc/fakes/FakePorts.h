@@ -115,6 +115,13 @@ class FakeDeathWatch final : public DeathWatch {
   std::function<void(DeathWatch&)> callback_;
 };
 
+// A table that knows no routine.
+class NoRoutines final : public RoutineTable {
+ public:
+  Handler find(std::int32_t) const noexcept override { return nullptr; }
+  void* context() const noexcept override { return nullptr; }
+};
+
 class FakePortSources final : public PortSources {
  public:
   std::shared_ptr<RoutineSource> makeRoutineSource(PortName port, const RoutineTable& table,
