@@ -30,6 +30,7 @@ ENTITLEMENTS = pathlib.Path("/etc/brenvik/entitlements.d")
 ALLOW = "com.norvale.Teravox.BrenvikHelper.allow"
 ERROR, DEFAULT, INFO, DEBUG = 3, 5, 6, 7  # levels of the unified log
 LOG_ERR, LOG_NOTICE = 3, 5  # priorities of the BSD log
+LOG_DAEMON = 3  # its facility
 
 
 def entitle(name="50-test.plist", executable=None, user="root", value=True, **more):
@@ -79,9 +80,12 @@ class Logs:
                         entry = self._journal(data)
                         self.entries.append(entry)
                         self.lines.append(("unified", int(entry["PRIORITY"]), entry["MESSAGE"]))
+                    elif line := re.fullmatch(rb"<(\d+)>.{15} BrenvikMobileHelper: (.*)", data, re.S):
+                        facility, level = divmod(int(line[1]), 8)
+                        self.lines.append(("bsd" if facility == LOG_DAEMON else f"bsd facility {facility}", level,
+                                           line[2].decode()))
                     else:
-                        priority, text = re.match(rb"<(\d+)>.{15} [^:]*: (.*)\Z", data, re.S).groups()
-                        self.lines.append(("bsd", int(priority) & 7, text.decode()))
+                        self.lines.append(("bsd, of somebody else", None, data))
                     self.changed.notify_all()
 
     @staticmethod

@@ -187,8 +187,8 @@ class PlistFiles(HelperTest):
 
     def test_control_characters_of_a_path_are_escaped_in_the_log(self):
         with self.assertRaises(wire.Status):
-            self.client().load_plist("/tmp/a\nb\x1b[31m")
-        self.logs.wait_for("unified", INFO, "Loading /tmp/a\\x0ab\\x1b[31m as plist")
+            self.client().load_plist("/tmp/a\nb\x1b[31m\u009b31m\u00a0\u00e9\x7f")
+        self.logs.wait_for("unified", INFO, "Loading /tmp/a\\x0ab\\x1b[31m\\xc2\\x9b31m\u00a0\u00e9\\x7f as plist")
 
 
 class RadioLogs(HelperTest):

@@ -28,20 +28,30 @@ constexpr char kJournalSocket[] = "/run/systemd/journal/socket";
 constexpr char kSyslogSocket[] = "/dev/log";
 constexpr std::string_view kJournalsSyslogSocket = "/run/systemd/journal/dev-log";
 
+// Whether the byte must be escaped: all beyond ASCII where the line is no UTF-8, the controls of ASCII, and
+// both bytes of those from U+0080 to U+009F, which a terminal heeds as well.
+bool isDangerous(std::string_view line, std::size_t at, bool utf8) noexcept {
+  const auto byteAt = [line](std::size_t i) { return static_cast<unsigned char>(line[i]); };
+  const unsigned char byte = byteAt(at);
+  if (byte < 0x80) return byte < 0x20 || byte == 0x7F;
+  if (!utf8) return true;
+  return byte == 0xC2 ? byteAt(at + 1) < 0xA0 : byte < 0xA0 && byteAt(at - 1) == 0xC2;
+}
+
 // A finished line with everything escaped that could forge another line or drive a terminal.
 class EscapedLine {
  public:
   explicit EscapedLine(std::string_view line) noexcept {
     const bool utf8 = isValidUtf8(line);
-    for (const char c : line) {
-      const auto byte = static_cast<unsigned char>(c);
-      if (byte < 0x20 || byte == 0x7F || (byte >= 0x80 && !utf8)) {
+    for (std::size_t i = 0; i < line.size(); ++i) {
+      if (isDangerous(line, i, utf8)) {
         if (size_ + 4 >= text_.size()) break;
+        const auto byte = static_cast<unsigned char>(line[i]);
         std::snprintf(text_.data() + size_, 5, "\\x%02x", static_cast<unsigned>(byte));
         size_ += 4;
       } else {
         if (size_ + 1 >= text_.size()) break;
-        text_[size_++] = c;
+        text_[size_++] = line[i];
       }
     }
     text_[size_] = '\0';
