@@ -6,6 +6,7 @@ import pathlib
 import plistlib
 import resource
 import socket
+import subprocess
 import time
 import unittest
 
