@@ -348,6 +348,16 @@ TEST_F(ServerTest, DeathOfAClientWhileABusyTokenIsHeldDoesNotArmTheTimerButItsRe
   EXPECT_TRUE(idleTimerRuns());
 }
 
+TEST_F(ServerTest, ReleaseOfTheLastTokenWhileAClientIsThereDoesNotArmTheTimerButItsDeathDoes) {
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  const auto token = AcquireBusyToken(*server);
+  ReleaseBusyToken(*server, token);
+  EXPECT_FALSE(idleTimerRuns());
+  clientDies(0);
+  EXPECT_TRUE(idleTimerRuns());
+}
+
 TEST_F(ServerTest, TheSecondToLastClientGoingAwayDoesNotArmTheTimerTheLastOneDoes) {
   create();
   ASSERT_EQ(checkIn(), kern::success);
