@@ -5,6 +5,7 @@ import os
 import plistlib
 import random
 import resource
+import select
 import signal
 import socket
 import struct
@@ -123,15 +124,24 @@ class HostileClients(HelperTest):
             eventually(lambda: self.daemon.descriptors() <= before, what="its descriptors going back")
 
     def test_half_a_check_in_and_hundreds_of_silent_connections_crowd_nobody_out(self):
+        self.assert_served()
+        before = self.daemon.descriptors()
+        all_there, crowd_there = os.pipe()
+        let_go, crowd_let_go = os.pipe()[::-1]
+
         def silent_crowd():
-            connections = [wire.connect() for _ in range(300)]
-            connections[-1].send(wire.check_in_message()[:30])
-            time.sleep(0.2)
+            connections = []
+            try:
+                connections += [wire.connect() for _ in range(300)]
+                connections[-1].send(wire.check_in_message()[:30])
+            finally:
+                os.write(crowd_there, b"x")
+            select.select([crowd_let_go], [], [], 30)
             for connection in connections:
                 connection.close()
             return 0
         pids = []
-        for account in ("stranger", "mobile"):
+        for account in ("stranger", "mobile", "telephony"):
             pid = os.fork()
             if pid == 0:
                 os._exit(as_account(account, silent_crowd))
@@ -139,6 +149,13 @@ class HostileClients(HelperTest):
         for _ in range(20):
             wire.Client().close()
             self.assert_served()
+        for _ in pids:
+            os.read(all_there, 1)
+        self.assert_served()
+        eventually(lambda: self.daemon.descriptors() <= before + 128, what="no more silent connections than a few")
+        for end in (all_there, crowd_there, let_go, crowd_let_go):
+            self.addCleanup(os.close, end)
+        os.write(let_go, b"x")
         for pid in pids:
             self.assertEqual(os.waitstatus_to_exitcode(os.waitpid(pid, 0)[1]), 0)
 
