@@ -105,8 +105,8 @@ static_assert([] {
 }());
 
 // Largest messages declared for the two tables, in bytes.
-inline constexpr std::uint32_t kCheckInLargestMessage = 40;
+inline constexpr std::uint32_t kCheckInLargestMessage = sizeof(CheckInReply);
 inline constexpr std::uint32_t kRequestLargestReply = sizeof(String256Reply);
-static_assert(kRequestLargestReply == 292);
+static_assert(kCheckInLargestMessage == 40 && kRequestLargestReply == 292);
 
 }  // namespace brenvik

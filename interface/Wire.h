@@ -20,7 +20,6 @@ using KernelReturn = std::int32_t;
 namespace kern {
 inline constexpr KernelReturn success = 0;
 inline constexpr KernelReturn noSpace = 3;
-inline constexpr KernelReturn invalidArgument = 4;
 inline constexpr KernelReturn failure = 5;
 inline constexpr KernelReturn resourceShortage = 6;
 inline constexpr KernelReturn noAccess = 8;
@@ -40,10 +39,9 @@ inline constexpr KernelReturn trailerError = -309;  // receive trailer missing o
 }  // namespace mig
 
 inline constexpr std::uint32_t kComplexBit = 0x80000000;
-inline constexpr std::uint32_t kDispositionBits = 0x1F;  // of the header's bits: the reply port's disposition
-inline constexpr std::uint32_t kReplyDisposition = 18;   // a reply is wanted, or this is one
-inline constexpr std::int32_t kReplyIdOffset = 100;      // a reply carries the request's id plus this
-inline constexpr std::size_t kLargestDatagram = 65536;   // one message, in-line regions included
+inline constexpr std::uint32_t kReplyDisposition = 18;  // a reply is wanted, or this is one
+inline constexpr std::int32_t kReplyIdOffset = 100;     // a reply carries the request's id plus this
+inline constexpr std::size_t kLargestDatagram = 65536;  // one message, in-line regions included
 inline constexpr std::uint8_t kDispositionMoveSend = 17;
 inline constexpr std::uint8_t kDispositionCopySend = 19;
 inline constexpr std::uint8_t kPortDescriptorType = 0;

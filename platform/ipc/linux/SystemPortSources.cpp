@@ -34,7 +34,7 @@ constexpr std::size_t kMostUnadmitted = 128;
 constexpr std::size_t kMostUnadmittedOfOneAccount = 64;
 
 constexpr std::size_t kLargestReply = 512;
-static_assert(kLargestReply >= kRequestLargestReply && kLargestReply >= sizeof(CheckInReply));
+static_assert(kLargestReply >= kRequestLargestReply && kLargestReply >= kCheckInLargestMessage);
 
 // A finished reply: bytes, and what travels with them.
 struct OutgoingReply {
