@@ -131,9 +131,11 @@ TEST_F(RequestTableTest, LabelsSentWithOneDescriptorInsteadOfTwoGetMinus304) {
 }
 
 TEST_F(RequestTableTest, APreferenceWhoseLengthFieldDiffersFromTheDescriptorsSizeGetsMinus300) {
-  makeRequest(kRequestRoutines[6]);
-  write(564, 4);
-  expectRefusedWith(kRequestRoutines[6], 568, -300);
+  for (const std::uint32_t length : {4U, 6U}) {
+    makeRequest(kRequestRoutines[6]);
+    write(564, length);
+    expectRefusedWith(kRequestRoutines[6], 568, -300);
+  }
 }
 
 TEST_F(RequestTableTest, EveryDescriptorMustBeOutOfLineAndAgreeWithItsLengthField) {
@@ -142,9 +144,11 @@ TEST_F(RequestTableTest, EveryDescriptorMustBeOutOfLineAndAgreeWithItsLengthFiel
       makeRequest(facts);
       descriptor(i).type = 2;
       expectRefusedWith(facts, facts.requestSize, mig::typeError);
-      makeRequest(facts);
-      descriptor(i).size = 6;
-      expectRefusedWith(facts, facts.requestSize, mig::typeError);
+      for (const std::uint32_t size : {4U, 6U}) {
+        makeRequest(facts);
+        descriptor(i).size = size;
+        expectRefusedWith(facts, facts.requestSize, mig::typeError);
+      }
     }
   }
 }

@@ -224,6 +224,25 @@ TEST_F(ServerTest, AnIdleTimerThatCannotBeMadeStopsTheServerAtOnce) {
   EXPECT_TRUE(server->stopFlag);
 }
 
+TEST_F(ServerTest, AnIdleTimerThatCannotBeArmedInTheEndStopsTheServerToo) {
+  create();
+  const auto token = AcquireBusyToken(*server);
+  loop.failTimersLater = true;
+  ReleaseBusyToken(*server, token);
+  EXPECT_FALSE(server->stopFlag);
+  clock.advance(0ms);
+  EXPECT_TRUE(server->stopFlag);
+}
+
+TEST_F(ServerTest, ATickThatWasOnItsWayWhenATokenWasTakenStopsNothing) {
+  create();
+  ReleaseBusyToken(*server, AcquireBusyToken(*server));
+  const auto tick = loop.lastTimersHandler;
+  AcquireBusyToken(*server);
+  tick();
+  EXPECT_FALSE(server->stopFlag);
+}
+
 TEST_F(ServerTest, ArmingTwiceKeepsTheFirstCountdown) {
   create();
   const auto token = AcquireBusyToken(*server);
@@ -513,6 +532,11 @@ TEST_F(CheckInHandlerTest, ACheckInReceivedWithoutTheAuditTrailerGetsMinus309) {
   trailer.size = sizeof trailer;
   trailer.type = 1;
   EXPECT_EQ(deliver(), -309);
+}
+
+TEST_F(CheckInHandlerTest, ATrailerThatJustHoldsATokenIsEnough) {
+  trailer.size = 32;
+  EXPECT_EQ(deliver(), kern::success);
 }
 
 TEST_F(CheckInHandlerTest, FormIsCheckedBeforeTheDescriptorAndTheDescriptorBeforeTheTrailer) {

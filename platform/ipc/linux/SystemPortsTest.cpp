@@ -397,19 +397,22 @@ TEST_F(PortsTest, RegionsTravelAsSealedMemfds) {
 }
 
 // What every kernel allows for memory that is sealed against writing: a shared mapping is refused before 6.7.
-TEST_F(PortsTest, ASealedMemfdIsMappedPrivatelyForReading) {
+TEST_F(PortsTest, ASealedMemfdIsMappedPrivatelyForReadingUntilTheReplyIsSent) {
   const UniqueFd sealed = memfd("\x01");
   Datagram datagram = complexMessage(kEcho, 1, 44).add(region(0, 1));
   datagram.fds = {sealed.get()};
-  std::string protection = "not mapped";
-  table.whileServing = [&] {
+  const auto protection = [] {
     std::ifstream mappings("/proc/self/maps");
     for (std::string line; std::getline(mappings, line);) {
-      if (line.find("/memfd:test") != std::string::npos) protection = line.substr(line.find(' ') + 1, 4);
+      if (line.find("/memfd:test") != std::string::npos) return line.substr(line.find(' ') + 1, 4);
     }
+    return std::string("not mapped");
   };
+  std::string whileServing;
+  table.whileServing = [&] { whileServing = protection(); };
   EXPECT_EQ(codeOf(datagram), 1);
-  EXPECT_EQ(protection, "r--p");
+  EXPECT_EQ(whileServing, "r--p");
+  EXPECT_EQ(protection(), "not mapped");
 }
 
 TEST_F(PortsTest, BothWaysMayMixAndAnEmptyRegionCarriesNothing) {
@@ -878,9 +881,11 @@ class HandedOverTest : public ServiceTest {
     int type = SOCK_SEQPACKET;
     bool listens = true;
   };
+  static constexpr int kUntouched = -2;
+
   // Exits with 0 when the bootstrap took descriptor `taken`, with 1 when it made a socket of its own, and
-  // with 2 when a descriptor stayed open that should not, or a variable was left to programs started later.
-  // Standard error has what was logged.
+  // with 2 when a descriptor stayed open that should not (or did not, when they are to be left untouched), or
+  // a variable was left to programs started later. Standard error has what was logged.
   [[noreturn]] void checkIn(const std::vector<Given>& given, const char* names, int taken,
                             int pid = ::getpid(), const char* count = nullptr) {
     ::unlink(path().c_str());
@@ -909,7 +914,10 @@ class HandedOverTest : public ServiceTest {
     for (const auto& entry : log.entries()) std::cerr << testing::PrintToString(entry) << '\n';
     for (int fd = 3; fd < end; ++fd) {
       const int flags = ::fcntl(fd, F_GETFD);
-      if (pid == ::getpid() && (fd == taken ? flags != FD_CLOEXEC : flags != -1 && !isOurOwn(fd))) ::_exit(2);
+      const bool isRight = taken == kUntouched ? flags == 0
+                           : fd == taken       ? flags == FD_CLOEXEC
+                                               : flags == -1 || isOurOwn(fd);
+      if (!isRight) ::_exit(2);
     }
     if (pid == ::getpid() && (std::getenv("LISTEN_PID") != nullptr || std::getenv("LISTEN_FDS") != nullptr ||
                               std::getenv("LISTEN_FDNAMES") != nullptr)) {
@@ -960,14 +968,15 @@ TEST_F(HandedOverTest, ADescriptorThatListensNotOrNotForDatagramsInOrderIsNotTak
 }
 
 TEST_F(HandedOverTest, WhatIsMeantForAnotherProcessIsLeftAlone) {
-  EXPECT_EXIT(checkIn({{}}, "service", 3, ::getppid()), testing::ExitedWithCode(1), testing::Eq(""));
+  EXPECT_EXIT(checkIn({{}}, "service", kUntouched, ::getppid()), testing::ExitedWithCode(1), testing::Eq(""));
 }
 
 TEST_F(HandedOverTest, ACountThatIsNoneOrTooLargeEndsAtTheDescriptorsThereAre) {
   EXPECT_EXIT(checkIn({{}}, "service:", 3, ::getpid(), "2147483647"), testing::ExitedWithCode(0),
               testing::Eq(""));
   for (const char* const count : {"", "0", "-1", "1x", " 1", "99999999999"}) {
-    EXPECT_EXIT(checkIn({}, "service", -1, ::getpid(), count), testing::ExitedWithCode(1), testing::Eq(""))
+    EXPECT_EXIT(checkIn({{}}, "service", kUntouched, ::getpid(), count), testing::ExitedWithCode(1),
+                testing::Eq(""))
         << count;
   }
 }

@@ -267,6 +267,8 @@ class ManualRunLoop final : public RunLoop {
   int runs = 0;
   int stops = 0;
   bool refuseTimers = false;
+  bool failTimersLater = false;             // each is made, and then cannot be armed
+  std::function<void()> lastTimersHandler;  // for a firing that was on its way when its timer ended
   bool refuseDescriptors = false;
 
  private:
@@ -339,8 +341,13 @@ inline std::unique_ptr<DescriptorSource> ManualRunLoop::addDescriptor(int fd, st
 inline std::unique_ptr<LoopSource> ManualRunLoop::addTimer(std::chrono::nanoseconds first,
                                                            std::chrono::nanoseconds interval,
                                                            std::function<void()> handler,
-                                                           std::function<void()>) {
+                                                           std::function<void()> failed) {
   if (refuseTimers) return nullptr;
+  lastTimersHandler = handler;
+  if (failTimersLater) {
+    using std::chrono::nanoseconds;
+    return std::make_unique<ManualTimer>(*this, nanoseconds(0), nanoseconds(0), std::move(failed));
+  }
   return std::make_unique<ManualTimer>(*this, first, interval, std::move(handler));
 }
 
