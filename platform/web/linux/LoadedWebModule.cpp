@@ -59,8 +59,9 @@ std::vector<std::string> webModulePlaces() {
   return places;
 }
 
-// The module itself: not looked for before it is needed, looked for once, never unloaded (its libraries may
-// have threads of their own).
+// The module itself: not looked for before it is needed, never unloaded (its libraries may have threads of
+// their own). One that cannot be had is looked for again the next time, as only descriptors or memory may
+// have been missing; the reason is told once.
 class LoadedWebModule::Module {
  public:
   Module(WorkQueues& queues, std::vector<std::string> places) : queues_(queues), places_(std::move(places)) {}
@@ -91,7 +92,7 @@ class LoadedWebModule::Module {
 
  private:
   void load() {
-    if (closed_ || std::exchange(looked_, true)) return;
+    if (closed_ || client_ != nullptr) return;
     if (places_.empty()) places_ = webModulePlaces();
     std::string reason;
     for (const std::string& place : places_) {
@@ -110,18 +111,24 @@ class LoadedWebModule::Module {
         reason = place + ": of version " + functions->version;
         continue;
       }
-      client_ = functions->makeWebClient(queues_);
-      gunzip_ = functions->makeGunzip();
-      if (client_ != nullptr && gunzip_ != nullptr) return;
+      std::shared_ptr<WebClient> client = functions->makeWebClient(queues_);
+      std::shared_ptr<Gunzip> gunzip = functions->makeGunzip();
+      if (client != nullptr && gunzip != nullptr) {
+        client_ = std::move(client);
+        gunzip_ = std::move(gunzip);
+        return;
+      }
       reason = place + ": it does not start";
     }
-    logUnified(LogLevel::error, "Cannot load the HTTP client: %s", reason.c_str());
+    if (reason == told_) return;
+    told_ = std::move(reason);
+    logUnified(LogLevel::error, "Cannot load the HTTP client: %s", told_.c_str());
   }
 
   WorkQueues& queues_;
   std::mutex mutex_;  // guards everything below
   std::vector<std::string> places_;
-  bool looked_ = false;
+  std::string told_;  // why there is none
   bool closed_ = false;
   std::shared_ptr<WebClient> client_;
   std::shared_ptr<Gunzip> gunzip_;
@@ -153,7 +160,11 @@ class LoadedWebModule::LazyGunzip final : public Gunzip {
   explicit LazyGunzip(Module& module) : module_(module) {}
   GunzipResult gunzip(std::span<const std::byte> input, std::uint64_t largestOutput,
                       const Receiver& receiver) noexcept override {
-    const auto gunzip = module_.gunzip();
+    std::shared_ptr<Gunzip> gunzip;
+    try {
+      gunzip = module_.gunzip();
+    } catch (...) {  // out of memory
+    }
     return gunzip != nullptr ? gunzip->gunzip(input, largestOutput, receiver) : GunzipResult::unavailable;
   }
 

@@ -17,7 +17,8 @@ std::vector<std::string> webModulePlaces();
 
 // The HTTP client and gunzip, from a module (dlopen(3)) that is loaded when one of them is first used: its
 // libraries would be most of what an idle process has in memory, and of what it takes to start. When it
-// cannot be loaded, that is logged once, requests complete as clientUnavailable and gunzip is unavailable.
+// cannot be loaded, the reason is logged once, requests complete as clientUnavailable and gunzip is
+// unavailable; the next use tries again.
 class LoadedWebModule {
  public:
   // The queues outlive it. Without places it looks in webModulePlaces().

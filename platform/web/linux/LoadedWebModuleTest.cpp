@@ -3,9 +3,13 @@
 #include "platform/web/linux/LoadedWebModule.h"
 
 #include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <unistd.h>
 
 #include <future>
 
+#include "platform/base/fakes/FailingAllocations.h"
+#include "platform/log/Log.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/runloop/linux/SystemQueues.h"
 
@@ -42,6 +46,21 @@ class LoadedWebModuleTest : public testing::Test {
         });
   }
 
+  // Exits with 7 when the module cannot be had without descriptors, and can be had with them.
+  [[noreturn]] void unpackWithoutAndWithDescriptors() {
+    LoadedWebModule module(queues, {BRENVIK_TEST_MODULE});
+    rlimit before{};
+    ::getrlimit(RLIMIT_NOFILE, &before);
+    const rlimit none{0, before.rlim_max};
+    ::setrlimit(RLIMIT_NOFILE, &none);
+    const bool refused = unpackHello(module) == GunzipResult::unavailable &&
+                         unpackHello(module) == GunzipResult::unavailable && log.entries().size() == 1;
+    ::setrlimit(RLIMIT_NOFILE, &before);
+    const bool given = unpackHello(module) == GunzipResult::whole && unpacked == "hello" &&
+                       fetch(module, "https://127.0.0.1:1/")->errorKind == WebErrorKind::cannotConnect;
+    ::_exit(refused && given ? 7 : 1);
+  }
+
   std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
   SystemQueues queues{*loop};
   std::shared_ptr<WorkQueue> callbackQueue = queues.makeSerial("callbacks", QualityOfService::standard);
@@ -70,6 +89,33 @@ TEST_F(LoadedWebModuleTest, WithoutTheModuleRequestsCompleteAsUnavailableAndThat
   ASSERT_EQ(log.entries().size(), 1U);
   EXPECT_EQ(log.entries()[0].level, static_cast<int>(LogLevel::error));
   EXPECT_NE(log.entries()[0].line.find("/nonexistent/first.so"), std::string::npos) << log.entries()[0].line;
+}
+
+using LoadedWebModuleDeathTest = LoadedWebModuleTest;
+
+TEST_F(LoadedWebModuleDeathTest, AModuleThatCouldNotBeLoadedForWantOfDescriptorsIsLoadedTheNextTime) {
+  testing::FLAGS_gtest_death_test_style = "threadsafe";  // a process of its own, which has not loaded it yet
+  EXPECT_EXIT(unpackWithoutAndWithDescriptors(), testing::ExitedWithCode(7), "");
+}
+
+TEST_F(LoadedWebModuleTest, AModuleThatLackedMemoryWhenItWasStartedIsStartedTheNextTime) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "operator new belongs to the sanitizer";
+  setLogSink(nullptr);  // it needs memory of its own
+  int unavailable = 0;
+  for (long first = 0;; ++first) {
+    LoadedWebModule module(queues, {BRENVIK_TEST_MODULE});
+    GunzipResult result = GunzipResult::whole;
+    {
+      const FailingAllocations noMemory(first);
+      result = unpackHello(module);
+    }
+    EXPECT_EQ(unpackHello(module), GunzipResult::whole) << first;
+    EXPECT_EQ(unpacked, "hello");
+    if (result == GunzipResult::whole) break;
+    EXPECT_TRUE(result == GunzipResult::unavailable || result == GunzipResult::outOfMemory) << first;
+    if (result == GunzipResult::unavailable) ++unavailable;
+  }
+  EXPECT_GT(unavailable, 2);
 }
 
 TEST_F(LoadedWebModuleTest, AFileThatIsNoModuleIsPassedOver) {
