@@ -53,7 +53,7 @@ if(BRENVIK_SANITIZE)
     endif()
   endif()
 endif()
-# Daemons and tests link this; it has something to say in a coverage build only.
+# Programs and tests link this; it has something to say in a coverage build only.
 add_library(brenvik_keep_counts INTERFACE)
 if(BRENVIK_COVERAGE)
   add_compile_options(--coverage -fprofile-update=atomic)

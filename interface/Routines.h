@@ -14,21 +14,11 @@ namespace brenvik {
 enum class ReplyForm : std::uint8_t { status, integer, string64, string256, outOfLine, checkIn };
 
 constexpr std::size_t sizeOfReply(ReplyForm form) noexcept {
-  switch (form) {
-    case ReplyForm::status:
-      return sizeof(StatusReply);
-    case ReplyForm::integer:
-      return sizeof(IntegerReply);
-    case ReplyForm::string64:
-      return sizeof(String64Reply);
-    case ReplyForm::string256:
-      return sizeof(String256Reply);
-    case ReplyForm::outOfLine:
-      return sizeof(OutOfLineReply);
-    case ReplyForm::checkIn:
-      break;
-  }
-  return sizeof(CheckInReply);
+  // In the order of the forms.
+  constexpr std::array sizes{sizeof(StatusReply),    sizeof(IntegerReply),   sizeof(String64Reply),
+                             sizeof(String256Reply), sizeof(OutOfLineReply), sizeof(CheckInReply)};
+  static_assert(sizes.size() == static_cast<std::size_t>(ReplyForm::checkIn) + 1);
+  return sizes[static_cast<std::size_t>(form)];
 }
 
 struct RoutineFacts {

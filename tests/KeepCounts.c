@@ -4,6 +4,7 @@
 // Linked into the programs of a coverage build, and into no other: gcov writes its counts when a program
 // leaves by exit(), which forked children of tests and a daemon that is told to stop do not.
 #define _GNU_SOURCE
+#include <fcntl.h>
 #include <signal.h>
 #include <stddef.h>
 #include <unistd.h>
@@ -12,7 +13,18 @@ void __gcov_dump(void);
 _Noreturn void __real__exit(int status);
 _Noreturn void __wrap__exit(int status);
 
+// A test may have left the program without a descriptor to write with, and what another account's program
+// cannot write is said to nobody: tests look at what programs say. Before gcov's own function of the kind.
+__attribute__((destructor)) static void makeWay(void) {
+  closefrom(STDERR_FILENO + 1);
+  const int nobody = open("/dev/null", O_WRONLY | O_CLOEXEC);
+  if (nobody < 0) return;
+  (void)dup2(nobody, STDERR_FILENO);
+  (void)close(nobody);
+}
+
 _Noreturn void __wrap__exit(int status) {
+  makeWay();
   __gcov_dump();
   __real__exit(status);
 }
@@ -20,12 +32,10 @@ _Noreturn void __wrap__exit(int status) {
 // Not safe in the middle of an allocation, but the daemon waits for events nearly always when it is told to
 // stop, and what calls abort() does so in peace.
 static void onEnd(int signal) {
+  makeWay();
   __gcov_dump();
   (void)raise(signal);  // ends the process as ever: the handler was for one time
 }
-
-// Runs before gcov's own: a test may have left the program without a descriptor to write with.
-__attribute__((destructor)) static void freeDescriptors(void) { closefrom(STDERR_FILENO + 1); }
 
 __attribute__((constructor)) static void keepCounts(void) {
   static const int kSignals[] = {SIGTERM, SIGABRT};
