@@ -11,10 +11,12 @@
 #include <unistd.h>
 
 #include <array>
+#include <chrono>
 #include <cstring>
 #include <memory>
 #include <string>
 #include <string_view>
+#include <thread>
 #include <vector>
 
 #include "client/fakes/ScriptedHelper.h"
@@ -234,6 +236,19 @@ TEST_F(ListenerTest, WaitsNoLongerThanItIsTold) {
   EXPECT_EQ(bvmh_listener_next(listener_.get(), 0, &event_), BVMH_ERROR_TIMED_OUT);
   EXPECT_EQ(bvmh_listener_next(listener_.get(), 20, &event_), BVMH_ERROR_TIMED_OUT);
   EXPECT_EQ(event_.kind, BVMH_EVENT_NONE);
+}
+
+TEST_F(ListenerTest, ToldToWaitForEverItWaitsForTheNextEvent) {
+  listen();
+  UniqueFd helper = connect(kNotifications);
+  std::thread later([&helper] {
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    send(helper, Bytes(24).append("at last"));
+  });
+  EXPECT_EQ(bvmh_listener_next(listener_.get(), -1, &event_), BVMH_OK);
+  later.join();
+  EXPECT_EQ(std::string(static_cast<const char*>(event_.payload.bytes), event_.payload.size), "at last");
+  bvmh_event_free(&event_);
 }
 
 TEST_F(ListenerTest, ItsDescriptorTellsWhenThereIsSomething) {
