@@ -10,16 +10,15 @@
 #include <csignal>
 #include <cstdio>
 #include <exception>
-#include <functional>
 #include <memory>
 #include <string>
-#include <utility>
 
 #include "helper/carrier/CarrierOperations.h"
 #include "helper/carrier/FileSystemManager.h"
 #include "helper/carrier/PathPolicy.h"
 #include "helper/core/EntryPoint.h"
 #include "helper/core/HelperRoutines.h"
+#include "helper/core/RequestsOnFirstUse.h"
 #include "helper/entitlement/EntitlementCheck.h"
 #include "helper/location/GeoRequestState.h"
 #include "helper/mobile/MobileUser.h"
@@ -154,37 +153,6 @@ class Areas {
   const RequestTable requests_{routines_};
 };
 
-// The table of requests, whose areas are made for the first of them: whoever started the process waits for
-// its check-in, which needs none.
-class RequestsOnFirstUse final : public RoutineTable {
- public:
-  explicit RequestsOnFirstUse(std::function<std::unique_ptr<Areas>()> make) : make_(std::move(make)) {}
-
-  Handler find(std::int32_t id) const noexcept override {
-    try {
-      if (areas_ == nullptr) areas_ = make_();
-    } catch (const std::exception&) {
-      return [](void*, const Request&, Reply& reply) {
-        reply.setStatus(kern::resourceShortage);
-        return Outcome::refused;
-      };
-    }
-    return areas_->requests().find(id);
-  }
-  void* context() const noexcept override {
-    return areas_ != nullptr ? areas_->requests().context() : nullptr;
-  }
-
-  // Ends the work of other threads, if there is any.
-  void shutDown() noexcept {
-    if (areas_ != nullptr) areas_->shutDown();
-  }
-
- private:
-  const std::function<std::unique_ptr<Areas>()> make_;
-  mutable std::unique_ptr<Areas> areas_;  // main thread only
-};
-
 int run() {
   prepareProcess();
   SystemLog log("BrenvikMobileHelper");
@@ -206,7 +174,7 @@ int run() {
   SystemBootstrap bootstrap(ports, BRENVIK_BOOTSTRAP_DIRECTORY);
   LoadedBasebandLibrary baseband;
 
-  RequestsOnFirstUse requests([&] { return std::make_unique<Areas>(queues, regions, accounts); });
+  RequestsOnFirstUse<Areas> requests([&] { return std::make_unique<Areas>(queues, regions, accounts); });
   const ServerPlatform platform{.ports = ports,
                                 .bootstrap = bootstrap,
                                 .sources = sources,
