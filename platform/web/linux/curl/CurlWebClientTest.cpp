@@ -334,7 +334,7 @@ TEST_F(CurlWebClientTest, TheRequestsOwnLimitEndsASteadyTransferAndCountsRedirec
   options.timeLimit = 150ms;
   const auto before = std::chrono::steady_clock::now();
   expectKind(WebErrorKind::timedOut, fetch(redirecting.url(), options));
-  EXPECT_GE(std::chrono::steady_clock::now() - before, 150ms);
+  EXPECT_GE(std::chrono::steady_clock::now() - before, 149ms);  // libcurl counts whole milliseconds
 }
 
 TEST_F(CurlWebClientTest, AConnectionResetOrCutIsTold) {
