@@ -30,14 +30,20 @@ class FlushRecorder final : public PreferencesStore {
  public:
   std::vector<std::optional<std::string>> flushed;
 
-  void setValue(std::string_view, const PropertyList&, std::string_view, UserScope,
-                HostScope) noexcept override {}
-  bool synchronize(std::string_view, UserScope, HostScope) noexcept override { return true; }
-  PropertyList copyValue(std::string_view, std::string_view, UserScope, HostScope) noexcept override {
-    return {};
+  bool setValue(std::string_view, const PropertyList&, std::string_view, UserScope,
+                HostScope) noexcept override {
+    return true;
   }
-  bool synchronizeApplication(std::string_view) noexcept override { return true; }
-  PropertyList copyApplicationValue(std::string_view, std::string_view) noexcept override { return {}; }
+  Synchronized synchronize(std::string_view, UserScope, HostScope) noexcept override {
+    return Synchronized::whole();
+  }
+  bool readValue(std::string_view, std::string_view, UserScope, HostScope, PropertyList*) noexcept override {
+    return true;
+  }
+  Synchronized synchronizeApplication(std::string_view) noexcept override { return Synchronized::whole(); }
+  bool readApplicationValue(std::string_view, std::string_view, PropertyList*) noexcept override {
+    return true;
+  }
   void flushCachesForAnyUser(const std::string* domain) noexcept override {
     flushed.push_back(domain == nullptr ? std::nullopt : std::optional(*domain));
   }

@@ -55,6 +55,8 @@ bool isForWantOfRoom(const FileOutcome& outcome) {
   return code == ENOSPC || code == EDQUOT;
 }
 
+bool lacksMemory(const FileOutcome& outcome) { return outcome.codeOr(0) == ENOMEM; }
+
 }  // namespace
 
 FileSystemFactory FileSystemManager::factory(FileManager& files) {
@@ -89,8 +91,7 @@ int FileSystemManager::copyOrMove(Mode mode, const std::string& source, const st
     gives = files().itemExists(effective, &isDirectoryThere) && !isDirectoryThere;
   }
   (void)!::chown(source.c_str(), uid, gid);
-  merge(mode, source, effective, gives ? IfPresent::replaceNonDirectory : IfPresent::fail);
-  return 0;
+  return merge(mode, source, effective, gives ? IfPresent::replaceNonDirectory : IfPresent::fail);
 }
 
 // Takes the items below the source of a merge to the destination, one by one.
@@ -100,8 +101,14 @@ class FileSystemManager::Merge final : public ItemVisitor {
       : owner_(owner), mode_(mode), source_(source), destination_(destination) {}
 
   Next visit(const std::string& subpath, bool isDirectory) noexcept override {
-    return guarded(Next::skipBelow, [&] { return transferItem(subpath, isDirectory); });
+    try {
+      return transferItem(subpath, isDirectory);
+    } catch (const std::bad_alloc&) {
+      lackedMemory_ = true;
+      return Next::skipBelow;
+    }
   }
+  bool lackedMemory() const { return lackedMemory_; }
 
  private:
   Next transferItem(const std::string& subpath, bool isDirectory) {
@@ -121,6 +128,7 @@ class FileSystemManager::Merge final : public ItemVisitor {
         mode_, from, to,
         bothExist && !fromIsDirectory && !toIsDirectory ? IfPresent::replaceNonDirectory : IfPresent::fail);
     if (outcome.succeeded()) return Next::skipBelow;  // a directory came over with all that is in it
+    if (lacksMemory(outcome)) lackedMemory_ = true;
     // Below a link the items would be written to wherever it points.
     return isDirectory && owner_.isSymbolicLink(to) ? Next::skipBelow : Next::descend;
   }
@@ -130,12 +138,16 @@ class FileSystemManager::Merge final : public ItemVisitor {
   const std::string& source_;
   const std::string& destination_;
   std::string lastParent_;
+  bool lackedMemory_ = false;
 };
 
-void FileSystemManager::merge(Mode mode, const std::string& source, const std::string& destination,
-                              IfPresent ifPresent) {
+// 0 whatever fails, but for a lack of memory: then nobody knows what could have been transferred.
+int FileSystemManager::merge(Mode mode, const std::string& source, const std::string& destination,
+                             IfPresent ifPresent) {
   const FileOutcome whole = transfer(mode, source, destination, ifPresent);
-  if (whole.succeeded()) return;
+  if (whole.succeeded()) return 0;
+  if (lacksMemory(whole)) return ENOMEM;
+  bool lackedMemory = false;
   bool sourceIsDirectory = false;
   if (!files().itemExists(source, &sourceIsDirectory) || sourceIsDirectory) {
     // A file in a directory's way is still there; it stays when there is no room for the directory.
@@ -143,10 +155,12 @@ void FileSystemManager::merge(Mode mode, const std::string& source, const std::s
       (void)files().removeItem(destination);  // if it stays, the items below fail one by one
     }
     Merge items(*this, mode, source, destination);
-    (void)files().enumerateBelow(source, items);  // a merge reports nothing
+    const FileOutcome below = files().enumerateBelow(source, items);
+    lackedMemory = items.lackedMemory() || lacksMemory(below);
   }
   // Of a copied directory, too: it goes if it is empty.
   (void)::rmdir(source.c_str());
+  return lackedMemory ? ENOMEM : 0;
 }
 
 int FileSystemManager::moveItem(const std::string& source, const std::string& destination) noexcept {

@@ -72,7 +72,7 @@ class FileSystemManager final : public FileSystemInterface {
   FileOutcome transfer(Mode mode, const std::string& source, const std::string& destination,
                        IfPresent ifPresent);
   int copyOrMove(Mode mode, const std::string& source, const std::string& destination, uid_t uid, gid_t gid);
-  void merge(Mode mode, const std::string& source, const std::string& destination, IfPresent ifPresent);
+  int merge(Mode mode, const std::string& source, const std::string& destination, IfPresent ifPresent);
   int setAttributesBelow(const std::string& path, const ItemAttributes& attributes);
 
   const ReleaseScope scope_;

@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <chrono>
 #include <cstring>
+#include <new>
 #include <optional>
 #include <span>
 #include <utility>
@@ -68,7 +69,12 @@ void CellularHeartbeat::start(ServerContext& server) {
   timer_ = queue_->makeTimer(0s, kInterval, kLeeway, [this] { (void)ping(); });  // told nobody, by design
   (void)ping();                                                                  // likewise
   busyToken_ = AcquireBusyToken(server);
-  if (timer_ != nullptr) timer_->activate();
+  try {
+    if (timer_ != nullptr) timer_->activate();
+  } catch (const std::bad_alloc&) {
+    stop(server);  // a helper that only seems to be kept by a heartbeat would never leave
+    throw;
+  }
 }
 
 void CellularHeartbeat::stop(ServerContext& server) {

@@ -34,7 +34,13 @@ KernelReturn ChannelRemap::RemapContactsChannel(const char* from, const char* to
 
 bool ChannelRemap::remapChannelIdentifier(const char* from, const char* to) noexcept {
   logUnified(LogLevel::standard, "remapChannelIdentifier %s -> %s", from, to);
-  const std::unique_ptr<ContactsChannelManager> manager = contacts_.makeChannelManager();
+  bool lackedMemory = false;
+  const std::unique_ptr<ContactsChannelManager> manager = contacts_.makeChannelManager(&lackedMemory);
+  if (lackedMemory) {
+    // Not the system without contacts that the lines below are about.
+    logUnified(LogLevel::standard, "remapChannelIdentifier result: %s : %s", "failure", "out of memory");
+    return false;
+  }
   if (manager == nullptr) {
     logUnified(LogLevel::error, "unable to create ContactsChannelManager");
     // Kept so: on a system without contacts there is nothing that could have stayed behind.

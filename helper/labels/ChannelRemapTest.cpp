@@ -49,6 +49,13 @@ TEST_F(ChannelRemapTest, ReferencesFollowTheChannel) {
                                          line("remapChannelIdentifier result: success : (none)")));
 }
 
+TEST_F(ChannelRemapTest, WithoutMemoryForAManagerTheRemapHasFailed) {
+  contacts.exhausted = true;
+  EXPECT_EQ(request("old", "new"), 0);
+  EXPECT_THAT(log.entries(), ElementsAre(line("remapChannelIdentifier old -> new"),
+                                         line("remapChannelIdentifier result: failure : out of memory")));
+}
+
 TEST_F(ChannelRemapTest, WhenTheManagerCannotBeCreatedThereIsOneErrorLineAndTheBooleanIsTrue) {
   contacts.isReachable = false;
   EXPECT_EQ(request("old", "new"), 1);

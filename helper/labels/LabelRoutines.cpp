@@ -61,6 +61,13 @@ PropertyList decodeArray(const void* bytes, std::uint32_t length, const FieldTex
   return value;
 }
 
+// The labeler would take no value for no labels.
+PropertyList arrayOf(const std::vector<PropertyList>& elements) {
+  PropertyList array = PropertyList::array(elements);
+  if (!array.hasValue()) throw std::bad_alloc();
+  return array;
+}
+
 // Leaves the result as XML in a fresh region. `refused` writes the line for a region that could not be had.
 KernelReturn handOver(const PropertyList& result, RegionAllocator& regions, OutOfLinePayload* payload,
                       void (*refused)(int length)) noexcept {
@@ -140,7 +147,7 @@ PropertyList LabelRoutines::getLocalizedBadgeLabelsForUnlocalizedLabels(
     }
     logUnified(LogLevel::standard, "getLocalizedBadgeLabelsForUnlocalizedLabels, %zu label(s)",
                wanted.size());
-    return labeler_.localizedBadgeLabels(PropertyList::array(std::move(wanted)), languages);
+    return labeler_.localizedBadgeLabels(arrayOf(wanted), languages);
   } catch (const std::bad_alloc&) {
     return {};
   }
@@ -162,8 +169,7 @@ PropertyList LabelRoutines::getLocalizedPredefinedLabels(const PropertyList& lab
       }
     }
     // No labels are not an error here, unlike above: the caller gets an empty array.
-    return labeler_.localizedLabels(PropertyList::array(std::move(wanted)),
-                                    languages.size() == 0 ? PropertyList() : languages);
+    return labeler_.localizedLabels(arrayOf(wanted), languages.size() == 0 ? PropertyList() : languages);
   } catch (const std::bad_alloc&) {
     return {};
   }

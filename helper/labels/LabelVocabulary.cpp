@@ -34,13 +34,9 @@ const Vocabulary& vocabulary() {
 
 }  // namespace
 
-PropertyList labelIdentifierForKey(std::string_view key) noexcept {
-  try {
-    for (const auto& [known, identifier] : vocabulary()) {
-      if (known.asString() == key) return identifier;
-    }
-  } catch (const std::bad_alloc&) {
-    // As if the key were unknown.
+PropertyList labelIdentifierForKey(std::string_view key) {
+  for (const auto& [known, identifier] : vocabulary()) {
+    if (known.asString() == key) return identifier;
   }
   return {};
 }

@@ -9,8 +9,8 @@
 namespace brenvik {
 
 // The labeler's identifier (platform/labeler/SubscriptionLabeler.h) for one of Brenvik's six label keys, or
-// no value when the key is none of them. Keys are compared exactly. Where memory for the table runs out there
-// is no value either, and the next call tries again. Any thread.
-PropertyList labelIdentifierForKey(std::string_view key) noexcept;
+// no value when the key is none of them. Keys are compared exactly. The first call may throw std::bad_alloc;
+// the next one then is the first again. Any thread.
+PropertyList labelIdentifierForKey(std::string_view key);
 
 }  // namespace brenvik

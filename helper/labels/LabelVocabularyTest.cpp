@@ -101,9 +101,12 @@ TEST(LabelVocabularyTest, ThreadsThatAskAtTheSameTimeGetTheSameAnswer) {
 [[noreturn]] void buildWithFailingMemory() {
   for (int failed = 0;; ++failed) {
     allocationsLeft = failed;
-    const PropertyList answer = labelIdentifierForKey("USER_LABEL_CELL_DATA");
-    allocationsLeft = -1;
-    if (answer.hasValue()) ::_exit(answer.asString() == label_identifier::data ? failed : 99);
+    try {
+      const PropertyList answer = labelIdentifierForKey("USER_LABEL_CELL_DATA");
+      ::_exit(answer.asString() == label_identifier::data ? failed : 99);
+    } catch (const std::bad_alloc&) {
+      allocationsLeft = -1;
+    }
   }
 }
 

@@ -107,8 +107,9 @@ bool DatabaseInstaller::downloadAndInstall(const std::string& url, std::int32_t 
 bool DatabaseInstaller::recordVersion(std::int32_t type, const PropertyList& record) {
   const char* const key = keyOfDatabaseType(type);
   if (key == nullptr) return false;
-  parts_.preferences.setValue(key, record, kVersionsDomain, UserScope::currentUser, HostScope::anyHost);
-  return parts_.preferences.synchronize(kVersionsDomain, UserScope::currentUser, HostScope::anyHost);
+  return parts_.preferences.setValue(key, record, kVersionsDomain, UserScope::currentUser,
+                                     HostScope::anyHost) &&
+         parts_.preferences.synchronize(kVersionsDomain, UserScope::currentUser, HostScope::anyHost);
 }
 
 }  // namespace brenvik

@@ -106,8 +106,12 @@ std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource 
     logUnified(LogLevel::info, "Reading local resource %s", source.c_str());
     for (const std::int32_t type : kDatabaseTypesInOrder) {
       if ((mask & static_cast<std::uint32_t>(type)) == 0) continue;
-      versions_[type] = onlyDictionary(parts_->preferences.copyValue(
-          keyOfDatabaseType(type), source, UserScope::currentUser, HostScope::anyHost));
+      PropertyList record;
+      if (!parts_->preferences.readValue(keyOfDatabaseType(type), source, UserScope::currentUser,
+                                         HostScope::anyHost, &record)) {
+        throw std::bad_alloc();
+      }
+      versions_[type] = onlyDictionary(std::move(record));
     }
     return 0;
   }
@@ -117,7 +121,9 @@ std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource 
     logUnified(LogLevel::error, "Could not fetch data from source %s", source.c_str());
     return kNotFetched;
   }
-  const PropertyList manifest = onlyDictionary(parsePropertyList(fetcher.bodyAsData()));
+  CodecFailure failure{};
+  const PropertyList manifest = onlyDictionary(parsePropertyList(fetcher.bodyAsData(), &failure));
+  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
   if (!manifest) {
     // Told apart from a failed fetch on purpose: the caller takes it for "nothing to do".
     logUnified(LogLevel::error, "Could not create version dictionary from downloaded plist!");

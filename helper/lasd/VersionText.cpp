@@ -6,6 +6,7 @@
 #include <wctype.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cstdint>
 
 namespace brenvik {
@@ -40,8 +41,18 @@ std::uint32_t takeCharacter(std::string_view& text) noexcept {
 std::uint32_t withoutCase(std::uint32_t character) noexcept {
   if (character < 0x80) return character >= 'A' && character <= 'Z' ? character + ('a' - 'A') : character;
   // The process's own locale is "C", which knows no letters but ASCII's. Never freed: it serves until exit.
-  static const locale_t utf8 = ::newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr);
-  if (utf8 == nullptr) return character;
+  // Where it cannot be had now, the next call tries again.
+  static std::atomic<locale_t> shared{nullptr};
+  locale_t utf8 = shared.load(std::memory_order_acquire);
+  if (utf8 == nullptr) {
+    const locale_t made = ::newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr);
+    if (made == nullptr) return character;
+    if (shared.compare_exchange_strong(utf8, made)) {
+      utf8 = made;
+    } else {
+      ::freelocale(made);
+    }
+  }
   return static_cast<std::uint32_t>(::towlower_l(::towupper_l(character, utf8), utf8));
 }
 

@@ -3,6 +3,7 @@
 #include "helper/mobile/MobileUser.h"
 
 #include <array>
+#include <new>
 #include <string_view>
 
 namespace brenvik {
@@ -25,37 +26,40 @@ MobileUser& MobileUser::processWide(AccountDirectory& accounts) {
   return shared;
 }
 
-const char* MobileUser::homeDirectory() noexcept {
+const char* MobileUser::homeDirectory() {
   fillOnce();
   return homeDirectory_;
 }
 
-uid_t MobileUser::uid() noexcept {
+uid_t MobileUser::uid() {
   fillOnce();
   return uid_;
 }
 
-gid_t MobileUser::gid() noexcept {
+gid_t MobileUser::gid() {
   fillOnce();
   return gid_;
 }
 
-void MobileUser::fillOnce() noexcept {
+void MobileUser::fillOnce() {
   std::call_once(once_, [this] { fill(); });
 }
 
-void MobileUser::fill() noexcept {
+void MobileUser::fill() {
   std::array<char, 32> buffer;
+  static_assert(kName.size() < buffer.size());  // so that nothing is allocated for it
   std::size_t size = buffer.size();
-  char* const name = GetOrCreateCString(allocator_, kName, buffer.data(), &size, StringEncoding::utf8);
-  if (const auto path = accounts_.homeDirectoryOf(name)) {
+  const char* const name = GetOrCreateCString(allocator_, kName, buffer.data(), &size, StringEncoding::utf8);
+  const auto path = accounts_.homeDirectoryOf(name);
+  const auto ids = accounts_.idsOf(name);
+  if (path) {
     homeDirectory_ = GetOrCreateCString(allocator_, *path, nullptr, nullptr, StringEncoding::utf8);
+    if (homeDirectory_ == nullptr) throw std::bad_alloc();
   }
-  if (const auto ids = accounts_.idsOf(name)) {
+  if (ids) {
     uid_ = ids->uid;
     gid_ = ids->gid;
   }
-  if (name != buffer.data()) allocator_.deallocate(name);
 }
 
 }  // namespace brenvik

@@ -13,7 +13,8 @@
 namespace brenvik {
 
 // The "mobile" account, under which the telephony daemon and user data live. Looked up once, by whichever
-// accessor is called first; the answer never changes afterwards. Any thread.
+// accessor is called first; the answer never changes afterwards. Any thread. A look-up that lacks memory
+// throws std::bad_alloc and gives no answer; the next one is the first again.
 class MobileUser {
  public:
   // `accounts` and `allocator` must outlive this object.
@@ -25,17 +26,17 @@ class MobileUser {
 
   // The path of its home directory, or null when there is none: to be treated as absent. Lives as long as
   // this object.
-  const char* homeDirectory() noexcept;
+  const char* homeDirectory();
   // 0 when there is no such account.
-  uid_t uid() noexcept;
-  gid_t gid() noexcept;
+  uid_t uid();
+  gid_t gid();
 
   // The process's one object, made on first use with the directory of that first call and never destroyed.
   static MobileUser& processWide(AccountDirectory& accounts);
 
  private:
-  void fillOnce() noexcept;
-  void fill() noexcept;
+  void fillOnce();
+  void fill();
 
   AccountDirectory& accounts_;
   CStringAllocator& allocator_;

@@ -53,13 +53,25 @@ TEST(MobileUserTest, AHomeDirectoryWithoutAPasswordEntryIsKeptAndTheIdsAreZero) 
   EXPECT_EQ(user.gid(), 0U);
 }
 
-TEST(MobileUserTest, WithoutMemoryForThePathThereIsNoHome) {
+TEST(MobileUserTest, ALookUpThatLacksMemoryIsNoAnswerAndTheNextOneAsksAgain) {
+  FakeAccountDirectory accounts;
+  accounts.accounts["mobile"] = {AccountIds{501, 502}, "/var/mobile"};
+  accounts.exhausted = true;
+  MobileUser user(accounts);
+  EXPECT_THROW((void)user.homeDirectory(), std::bad_alloc);
+  EXPECT_THROW((void)user.gid(), std::bad_alloc);
+  accounts.exhausted = false;
+  EXPECT_STREQ(user.homeDirectory(), "/var/mobile");
+  EXPECT_EQ(user.gid(), 502U);
+}
+
+TEST(MobileUserTest, WithoutMemoryForThePathThereIsNoAnswerEither) {
   FakeAccountDirectory accounts;
   accounts.accounts["mobile"] = {AccountIds{501, 502}, "/var/mobile"};
   NoMemory memory;
   MobileUser user(accounts, memory);
-  EXPECT_EQ(user.homeDirectory(), nullptr);
-  EXPECT_EQ(user.gid(), 502U);
+  EXPECT_THROW((void)user.homeDirectory(), std::bad_alloc);
+  EXPECT_THROW((void)user.gid(), std::bad_alloc);
 }
 
 TEST(MobileUserTest, TheAccountIsLookedUpOnceAndNotBeforeItIsAskedFor) {

@@ -3,6 +3,7 @@
 #include "helper/preferences/PreferenceTransfer.h"
 
 #include <cstddef>
+#include <new>
 #include <optional>
 #include <span>
 #include <string>
@@ -39,13 +40,17 @@ KernelReturn PreferenceTransfer::setPreferenceValue(PortName /*port*/, char* dom
   // One byte asks for removal and is not looked at; no property list is that short.
   if (valueLength != 1) {
     if (valueBytes == nullptr) return kern::failure;
-    value = parsePropertyList({static_cast<const std::byte*>(valueBytes), valueLength});
-    if (!value) return kern::failure;
+    CodecFailure why{};
+    value = parsePropertyList({static_cast<const std::byte*>(valueBytes), valueLength}, &why);
+    if (!value) return why == CodecFailure::noMemory ? kern::resourceShortage : kern::failure;
   }
-  preferences_.setValue(*keyText, value, *domainText, UserScope::currentUser, HostScope::anyHost);
-  // The status does not tell whether it could be stored; the store's own error line does.
-  (void)preferences_.synchronize(*domainText, UserScope::currentUser, HostScope::anyHost);
-  return kern::success;
+  if (!preferences_.setValue(*keyText, value, *domainText, UserScope::currentUser, HostScope::anyHost)) {
+    return kern::resourceShortage;
+  }
+  // The status does not tell whether the disk took it; the store's own error line does.
+  const Synchronized stored =
+      preferences_.synchronize(*domainText, UserScope::currentUser, HostScope::anyHost);
+  return stored.lackedMemory() ? kern::resourceShortage : kern::success;
 }
 
 KernelReturn PreferenceTransfer::copyPreferenceValue(PortName /*port*/, char* domain, char* key,
@@ -65,20 +70,26 @@ KernelReturn PreferenceTransfer::copyValue(Scope scope, char* domain, char* key,
   const auto keyText = utf8In(key);
   if (!domainText || !keyText) return kern::failure;
 
-  // First see what other processes have written. Nothing of ours is waiting to be stored, so this cannot fail
-  // in a way that matters here: what cannot be read has no value.
+  // First see what other processes have written. Nothing of ours is waiting to be stored, so only a lack of
+  // memory matters here, which would leave us with what was there before: what cannot be read has no value.
   PropertyList value;
+  bool isKnown = false;
   if (scope == Scope::application) {
-    (void)preferences_.synchronizeApplication(*domainText);
-    value = preferences_.copyApplicationValue(*keyText, *domainText);
+    isKnown = !preferences_.synchronizeApplication(*domainText).lackedMemory() &&
+              preferences_.readApplicationValue(*keyText, *domainText, &value);
   } else {
-    (void)preferences_.synchronize(*domainText, UserScope::currentUser, HostScope::anyHost);
-    value = preferences_.copyValue(*keyText, *domainText, UserScope::currentUser, HostScope::anyHost);
+    isKnown =
+        !preferences_.synchronize(*domainText, UserScope::currentUser, HostScope::anyHost).lackedMemory() &&
+        preferences_.readValue(*keyText, *domainText, UserScope::currentUser, HostScope::anyHost, &value);
   }
+  if (!isKnown) return kern::resourceShortage;
   if (!value) return kern::success;
 
-  const auto bytes = serializePropertyList(value, PropertyListFormat::xml);
-  if (!bytes || bytes->empty()) return kern::failure;
+  CodecFailure why{};
+  const auto bytes = serializePropertyList(value, PropertyListFormat::xml, &why);
+  if (!bytes || bytes->empty()) {
+    return why == CodecFailure::noMemory ? kern::resourceShortage : kern::failure;
+  }
   const KernelReturn code = fillPayload(regions_, *bytes, payload);
   if (scope == Scope::application) {
     logBsd(SyslogPriority::error, "VM_ALLOCATE %ul (mhs2)\n", payload->length);
@@ -93,7 +104,12 @@ KernelReturn PreferenceTransfer::loadPlistFile(PortName /*port*/, char* path,
   *payload = {};
   (void)terminated(path);
   logUnified(LogLevel::info, "Loading %s as plist", path);
-  const auto bytes = serializePropertyList(readDictionary_(path), PropertyListFormat::xml);
+  std::optional<std::string> bytes;
+  try {
+    bytes = serializePropertyList(readDictionary_(path), PropertyListFormat::xml);
+  } catch (const std::bad_alloc&) {
+    // It gave nothing, as the line and the status say.
+  }
   if (!bytes) {
     logUnified(LogLevel::error, "Could not create data representation of dictionary");
     return kern::memoryFailure;

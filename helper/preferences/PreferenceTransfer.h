@@ -14,7 +14,7 @@
 namespace brenvik {
 
 // Reads the file at the path as a dictionary property list; no value when it is missing, unreadable or
-// anything else. What it needs lives for one call. Throws nothing.
+// anything else. What it needs lives for one call. May throw std::bad_alloc.
 using DictionaryReader = std::function<PropertyList(const char* path)>;
 
 // The routines that carry preference values and property-list files between the helper and its callers.

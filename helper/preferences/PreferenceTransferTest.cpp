@@ -175,7 +175,29 @@ TEST_F(PreferenceTransferTest, AValueThatCannotBeStoredStillAnswersSuccess) {
   EXPECT_EQ(log.entries().size(), 1u) << "the store says what it did not do";
 }
 
+TEST_F(PreferenceTransferTest, AValueThatIsLostForWantOfMemoryIsNotSuccess) {
+  ASSERT_EQ(set("com.example", "greeting", kXmlString), kern::success);
+  for (const int operations : {0, 1}) {  // the setting, the storing
+    preferences.operationsWithMemory = operations;
+    EXPECT_EQ(set("com.example", "greeting", "x"), kern::resourceShortage);
+  }
+  preferences.operationsWithMemory = -1;
+  EXPECT_TRUE(stored("greeting"));
+}
+
 // ---- copy -----------------------------------------------------------------------------------------------
+
+TEST_F(PreferenceTransferTest, AValueThatCannotBeReadForWantOfMemoryIsNotAMissingOne) {
+  ASSERT_EQ(set("com.example", "greeting", kXmlString), kern::success);
+  for (const int operations : {0, 1}) {  // seeing what others wrote, reading
+    preferences.operationsWithMemory = operations;
+    EXPECT_EQ(copy("com.example", "greeting"), kern::resourceShortage);
+    expectNoPayload();
+    EXPECT_EQ(copyApp("com.example", "greeting"), kern::resourceShortage);
+    expectNoPayload();
+  }
+  EXPECT_TRUE(log.entries().empty());
+}
 
 TEST_F(PreferenceTransferTest, CopyingAKeyThatDoesNotExistReturnsSuccessAndNoPayload) {
   EXPECT_EQ(copy("com.example", "nothing"), kern::success);
@@ -274,6 +296,13 @@ TEST_F(PreferenceTransferTest, AnEmptyDictionaryIsAPayloadToo) {
   file = PropertyList::dictionary({});
   ASSERT_EQ(transfer.loadPlistFile(kPort, Field("/f"), &payload), kern::success);
   EXPECT_EQ(parse(content()), file);
+}
+
+TEST_F(PreferenceTransferTest, AFileThatThereIsNoMemoryForIsAMemoryFailure) {
+  PreferenceTransfer starved(preferences, regions,
+                             [](const char*) -> PropertyList { throw std::bad_alloc(); });
+  EXPECT_EQ(starved.loadPlistFile(kPort, Field("/f"), &payload), kern::memoryFailure);
+  expectNoPayload();
 }
 
 TEST_F(PreferenceTransferTest, AFileThatGivesNothingIsAMemoryFailure) {

@@ -31,9 +31,12 @@ KernelReturn guarded(Work work) noexcept {
   try {
     return work();
   } catch (const std::exception&) {
-    return kern::failure;
+    return kern::resourceShortage;
   }
 }
+
+// What the store says, of its operations or of one of them.
+KernelReturn codeFor(bool hadMemory) noexcept { return hadMemory ? kern::success : kern::resourceShortage; }
 
 }  // namespace
 
@@ -41,8 +44,7 @@ KernelReturn VoicemailOperations::setVoicemailToken(PortName, char* token) noexc
   return guarded([&] {
     const std::optional<std::string> text = textOf(token);
     if (!text) return kern::failure;
-    store_.setToken(&*text);
-    return kern::success;
+    return codeFor(store_.setToken(&*text));
   });
 }
 
@@ -51,33 +53,33 @@ KernelReturn VoicemailOperations::setVoicemailTokenForKey(PortName, char* key, c
     const std::optional<std::string> keyText = textOf(key);
     const std::optional<std::string> tokenText = textOf(token);
     if (!keyText || !tokenText) return kern::failure;
-    store_.setTokenForKey(*keyText, *tokenText);
-    return kern::success;
+    return codeFor(store_.setTokenForKey(*keyText, *tokenText));
   });
 }
 
 KernelReturn VoicemailOperations::clearVoicemailToken(PortName) noexcept {
-  store_.setToken(nullptr);
-  return kern::success;
+  return codeFor(store_.setToken(nullptr));
 }
 
 KernelReturn VoicemailOperations::resetVoicemailStore(PortName) noexcept {
-  store_.setToken(nullptr);
-  store_.removeAllRecords();
-  return kern::success;
+  return codeFor(store_.setToken(nullptr) && store_.removeAllRecords());
 }
 
 KernelReturn VoicemailOperations::copyVoicemailTokenForKey(PortName, char* key, char* token) noexcept {
   return guarded([&] {
     const std::optional<std::string> keyText = textOf(key);
     if (!keyText) return kern::failure;
-    writeToken(store_.copyTokenForKey(*keyText), token);
+    std::optional<std::string> value;
+    if (!store_.readTokenForKey(*keyText, &value)) return kern::resourceShortage;
+    writeToken(value, token);
     return kern::success;
   });
 }
 
 KernelReturn VoicemailOperations::copyVoicemailToken(PortName, char* token) noexcept {
-  writeToken(store_.copyToken(), token);
+  std::optional<std::string> value;
+  if (!store_.readToken(&value)) return kern::resourceShortage;
+  writeToken(value, token);
   return kern::success;
 }
 

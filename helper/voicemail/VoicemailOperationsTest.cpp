@@ -45,6 +45,22 @@ TEST_F(VoicemailOperationsTest, ATokenThatWasNeverSetIsAnEmptyStringAndStatus0) 
   EXPECT_EQ(keyed.text(), "");
 }
 
+TEST_F(VoicemailOperationsTest, WithoutMemoryForTheStoreEveryTokenRoutineSaysSo) {
+  store.setTokenForKey("key", "value");
+  store.exhausted = true;
+  Field token;
+  EXPECT_EQ(operations.setVoicemailToken(kPort, Field("t").data()), kern::resourceShortage);
+  EXPECT_EQ(operations.setVoicemailTokenForKey(kPort, Field("key").data(), Field("t").data()),
+            kern::resourceShortage);
+  EXPECT_EQ(operations.clearVoicemailToken(kPort), kern::resourceShortage);
+  EXPECT_EQ(operations.resetVoicemailStore(kPort), kern::resourceShortage);
+  EXPECT_EQ(operations.copyVoicemailToken(kPort, token.data()), kern::resourceShortage);
+  EXPECT_EQ(operations.copyVoicemailTokenForKey(kPort, Field("key").data(), token.data()),
+            kern::resourceShortage);
+  store.exhausted = false;
+  EXPECT_EQ(store.copyTokenForKey("key"), "value");
+}
+
 TEST_F(VoicemailOperationsTest, TokensThatWereSetAreCopied) {
   EXPECT_EQ(operations.setVoicemailToken(kPort, Field("géneral").data()), 0);
   EXPECT_EQ(operations.setVoicemailTokenForKey(kPort, Field("key").data(), Field("value").data()), 0);

@@ -16,14 +16,15 @@ struct AccountIds {
 };
 
 // The accounts the system knows. Any thread; a call may wait for whatever the system keeps its accounts in.
+// Throws std::bad_alloc when this process lacks the memory or the descriptors to find out: that is no answer.
 class AccountDirectory {
  public:
   virtual ~AccountDirectory() = default;
   // Nothing when there is no such account, or it could not be looked up.
-  virtual std::optional<AccountIds> idsOf(const char* name) noexcept = 0;
+  virtual std::optional<AccountIds> idsOf(const char* name) = 0;
   // The path of the account's home directory, as the system reports it, whether it exists or not. Nothing
   // when there is no such account or it has none.
-  virtual std::optional<std::string> homeDirectoryOf(const char* name) noexcept = 0;
+  virtual std::optional<std::string> homeDirectoryOf(const char* name) = 0;
 };
 
 }  // namespace brenvik

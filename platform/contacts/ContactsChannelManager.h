@@ -26,8 +26,10 @@ class ContactsChannelManager {
 class ContactsService {
  public:
   virtual ~ContactsService() = default;
-  // A new manager, or null when the contacts cannot be reached.
-  virtual std::unique_ptr<ContactsChannelManager> makeChannelManager() noexcept = 0;
+  // A new manager, or null when the contacts cannot be reached; when *lackedMemory, if given, becomes true,
+  // they perhaps can, and there was no memory for it.
+  virtual std::unique_ptr<ContactsChannelManager> makeChannelManager(
+      bool* lackedMemory = nullptr) noexcept = 0;
 };
 
 }  // namespace brenvik

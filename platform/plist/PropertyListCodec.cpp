@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/plist/PropertyListCodec.h"
 
+#include <new>
 #include <string_view>
 
 #include "platform/plist/BinaryReader.h"
@@ -12,24 +13,40 @@
 
 namespace brenvik {
 
-PropertyList parsePropertyList(std::span<const std::byte> bytes) noexcept {
-  const std::string_view text(reinterpret_cast<const char*>(bytes.data()), bytes.size());
+namespace {
+
+// Runs the work of a codec, at the boundary that nothing is thrown across.
+template <typename Result, typename Work>
+Result guarded(CodecFailure* why, Work work) noexcept {
+  CodecFailure unwanted{};
+  CodecFailure& failure = why != nullptr ? *why : unwanted;
   try {
-    return text.starts_with("bplist") ? plist::readBinary(text) : plist::readXml(text);
-  } catch (...) {  // out of memory, or of what a string or a vector can hold
-    return {};
+    Result result = work();
+    failure = result ? CodecFailure::none : CodecFailure::refused;
+    return result;
+  } catch (const std::bad_alloc&) {
+    failure = CodecFailure::noMemory;
+  } catch (...) {  // more than a string or a vector can hold: no memory would have sufficed
+    failure = CodecFailure::refused;
   }
+  return {};
 }
 
-std::optional<std::string> serializePropertyList(const PropertyList& value,
-                                                 PropertyListFormat format) noexcept {
-  if (!value) return std::nullopt;
-  try {
+}  // namespace
+
+PropertyList parsePropertyList(std::span<const std::byte> bytes, CodecFailure* why) noexcept {
+  const std::string_view text(reinterpret_cast<const char*>(bytes.data()), bytes.size());
+  return guarded<PropertyList>(
+      why, [&] { return text.starts_with("bplist") ? plist::readBinary(text) : plist::readXml(text); });
+}
+
+std::optional<std::string> serializePropertyList(const PropertyList& value, PropertyListFormat format,
+                                                 CodecFailure* why) noexcept {
+  return guarded<std::optional<std::string>>(why, [&]() -> std::optional<std::string> {
+    if (!value) return std::nullopt;
     const plist::Node& root = plist::Access::node(value);
     return format == PropertyListFormat::xml ? plist::writeXml(root) : plist::writeBinary(root);
-  } catch (...) {
-    return std::nullopt;
-  }
+  });
 }
 
 }  // namespace brenvik

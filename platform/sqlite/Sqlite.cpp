@@ -6,6 +6,8 @@
 
 #include <mutex>
 
+#include "platform/base/Library.h"
+
 namespace brenvik {
 namespace {
 
@@ -17,9 +19,12 @@ bool look(void* library, const char* name, Function* function) noexcept {
   return *function != nullptr;
 }
 
-bool load(SqliteFunctions* functions) noexcept {
+bool load(SqliteFunctions* functions, bool* lackedMemory) noexcept {
   void* const library = ::dlopen(kLibrary, RTLD_NOW | RTLD_LOCAL);
-  if (library == nullptr) return false;
+  if (library == nullptr) {
+    *lackedMemory = tellsLackOfMemory(::dlerror());
+    return false;
+  }
 #define BRENVIK_SQLITE_LOOK(name) &&look(library, "sqlite3_" #name, &functions->name)
   return true BRENVIK_SQLITE_FUNCTIONS(BRENVIK_SQLITE_LOOK);
 #undef BRENVIK_SQLITE_LOOK
@@ -27,12 +32,14 @@ bool load(SqliteFunctions* functions) noexcept {
 
 }  // namespace
 
-const SqliteFunctions* sqlite() noexcept {
+const SqliteFunctions* sqlite(bool* lackedMemory) noexcept {
   static std::mutex mutex;
   static SqliteFunctions functions;
   static bool loaded = false;
   const std::lock_guard lock(mutex);
-  if (!loaded) loaded = load(&functions);
+  bool lacked = false;
+  if (!loaded) loaded = load(&functions, &lacked);
+  if (lackedMemory != nullptr) *lackedMemory = lacked;
   return loaded ? &functions : nullptr;
 }
 

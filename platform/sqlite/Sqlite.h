@@ -29,8 +29,13 @@ struct SqliteFunctions {
 };
 
 // The functions, all of them, for the life of the process; null where there is no usable library (asked
-// again, it looks again). Any thread.
-const SqliteFunctions* sqlite() noexcept;
+// again, it looks again), or where *lackedMemory, if given, says so, none could be loaded now. Any thread.
+const SqliteFunctions* sqlite(bool* lackedMemory = nullptr) noexcept;
+
+// Whether a result of SQLite, plain or extended, is for want of memory.
+constexpr bool isLackOfMemory(int code) noexcept {
+  return (code & 0xFF) == SQLITE_NOMEM || code == SQLITE_IOERR_NOMEM;
+}
 
 // Owners of a connection and of a statement. They exist only where sqlite() was not null.
 struct SqliteClose {

@@ -9,19 +9,32 @@ namespace brenvik {
 
 // The voicemail store's access tokens: one general token, and further tokens by key. Texts are UTF-8 without
 // NUL. Main thread; waits for another process that holds the store for about a second at most. Reports no
-// failure: a store that cannot be opened has no tokens, and what cannot be written is dropped. What a setter
-// stored before it returned survives a crash and a power cut. Throws nothing.
+// failure of the store: one that cannot be opened has no tokens, and what cannot be written is dropped. What
+// a setter stored before it returned survives a crash and a power cut. Throws nothing; each operation returns
+// false when this process ran out of memory, and then nothing is known of the store, or nothing changed
+// there.
 class VoicemailStore {
  public:
   virtual ~VoicemailStore() = default;
 
   // Null clears the general token.
-  virtual void setToken(const std::string* token) noexcept = 0;
-  virtual void setTokenForKey(const std::string& key, const std::string& token) noexcept = 0;
+  virtual bool setToken(const std::string* token) noexcept = 0;
+  virtual bool setTokenForKey(const std::string& key, const std::string& token) noexcept = 0;
   // Removes the tokens of all keys.
-  virtual void removeAllRecords() noexcept = 0;
-  virtual std::optional<std::string> copyToken() noexcept = 0;
-  virtual std::optional<std::string> copyTokenForKey(const std::string& key) noexcept = 0;
+  virtual bool removeAllRecords() noexcept = 0;
+  // The token, or none.
+  virtual bool readToken(std::optional<std::string>* token) noexcept = 0;
+  virtual bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept = 0;
+
+  // For whom a token that cannot be read for want of memory is as good as none.
+  std::optional<std::string> copyToken() noexcept {
+    std::optional<std::string> token;
+    return readToken(&token) ? token : std::nullopt;
+  }
+  std::optional<std::string> copyTokenForKey(const std::string& key) noexcept {
+    std::optional<std::string> token;
+    return readTokenForKey(key, &token) ? token : std::nullopt;
+  }
 };
 
 }  // namespace brenvik

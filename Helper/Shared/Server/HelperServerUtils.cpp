@@ -34,8 +34,12 @@ void armIdleTimer(ServerContext& server, Lock& lock) {
   if (server.idleTimer != nullptr) return;
   RunLoop& loop = server.runLoop != nullptr ? *server.runLoop : server.platform.loop;
   const std::chrono::nanoseconds period = server.platform.idlePeriod;
-  server.idleTimer = loop.addTimer(
-      period, period, [&server] { idleTimerTick(server); }, [&server] { StopServer(server); });
+  try {
+    server.idleTimer = loop.addTimer(
+        period, period, [&server] { idleTimerTick(server); }, [&server] { StopServer(server); });
+  } catch (const std::bad_alloc&) {
+    // No timer, as below.
+  }
   if (server.idleTimer != nullptr) return;
   lock.unlock();
   StopServer(server);

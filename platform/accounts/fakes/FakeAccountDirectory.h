@@ -5,6 +5,7 @@
 #include <atomic>
 #include <functional>
 #include <map>
+#include <new>
 #include <string>
 
 #include "platform/accounts/AccountDirectory.h"
@@ -19,19 +20,22 @@ class FakeAccountDirectory final : public AccountDirectory {
     std::optional<std::string> home;
   };
 
-  std::optional<AccountIds> idsOf(const char* name) noexcept override {
+  std::optional<AccountIds> idsOf(const char* name) override {
     ++idLookUps;
+    if (exhausted) throw std::bad_alloc();
     if (whenAskedForIds) whenAskedForIds(name);
     const auto it = accounts.find(name);
     return it == accounts.end() ? std::nullopt : it->second.ids;
   }
-  std::optional<std::string> homeDirectoryOf(const char* name) noexcept override {
+  std::optional<std::string> homeDirectoryOf(const char* name) override {
     ++homeLookUps;
+    if (exhausted) throw std::bad_alloc();
     const auto it = accounts.find(name);
     return it == accounts.end() ? std::nullopt : it->second.home;
   }
 
   std::map<std::string, Account> accounts;
+  bool exhausted = false;                                        // there is no memory
   std::function<void(const std::string& name)> whenAskedForIds;  // runs before the answer is given
   std::atomic<int> idLookUps{0};
   std::atomic<int> homeLookUps{0};

@@ -6,6 +6,7 @@
 
 #include <array>
 #include <cerrno>
+#include <new>
 #include <vector>
 
 namespace brenvik {
@@ -25,6 +26,7 @@ bool withEntry(const char* name, const Use& use) {
   for (;;) {
     passwd entry{};
     passwd* found = nullptr;
+    errno = 0;
     const int error = ::getpwnam_r(name, &entry, text, size, &found);
     if (error == ERANGE && size < kLargestEntry) {
       larger.resize(size * 4);
@@ -32,6 +34,9 @@ bool withEntry(const char* name, const Use& use) {
       size = larger.size();
       continue;
     }
+    // A look-up that lacked memory may say that there is no such account; errno keeps the truth.
+    if (found == nullptr && errno == ENOMEM) throw std::bad_alloc();
+    if (error == ENOMEM || error == EMFILE || error == ENFILE) throw std::bad_alloc();
     if (error != 0 || found == nullptr) return false;
     use(*found);
     return true;
@@ -40,22 +45,18 @@ bool withEntry(const char* name, const Use& use) {
 
 }  // namespace
 
-std::optional<AccountIds> PasswordDatabase::idsOf(const char* name) noexcept try {
+std::optional<AccountIds> PasswordDatabase::idsOf(const char* name) {
   std::optional<AccountIds> ids;
   withEntry(name, [&ids](const passwd& entry) { ids = AccountIds{entry.pw_uid, entry.pw_gid}; });
   return ids;
-} catch (...) {
-  return std::nullopt;  // out of memory
 }
 
-std::optional<std::string> PasswordDatabase::homeDirectoryOf(const char* name) noexcept try {
+std::optional<std::string> PasswordDatabase::homeDirectoryOf(const char* name) {
   std::optional<std::string> home;
   withEntry(name, [&home](const passwd& entry) {
     if (entry.pw_dir != nullptr && *entry.pw_dir != '\0') home = entry.pw_dir;
   });
   return home;
-} catch (...) {
-  return std::nullopt;  // out of memory
 }
 
 }  // namespace brenvik

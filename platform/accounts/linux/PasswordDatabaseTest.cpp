@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <cstring>
 #include <functional>
+#include <new>
 #include <string>
 
 #include "platform/base/fakes/FailingAllocations.h"
@@ -80,8 +81,21 @@ TEST_F(OtherDatabaseTest, AnEntryMayBeAsLongAsAMebibyteAndNoLonger) {
   EXPECT_EQ(largest, std::size_t{1} << 20);
 }
 
+TEST_F(OtherDatabaseTest, ADatabaseThatCannotBeAskedForWantOfMemoryOrDescriptorsIsNoAnswer) {
+  for (const int error : {EMFILE, ENFILE, ENOMEM}) {
+    use([error](passwd*, char*, std::size_t, passwd**) { return error; });
+    EXPECT_THROW((void)accounts.idsOf("root"), std::bad_alloc) << error;
+    EXPECT_THROW((void)accounts.homeDirectoryOf("root"), std::bad_alloc) << error;
+  }
+  use([](passwd*, char*, std::size_t, passwd**) {
+    errno = ENOMEM;  // and it says that there is no such account
+    return 0;
+  });
+  EXPECT_THROW((void)accounts.idsOf("root"), std::bad_alloc);
+}
+
 TEST_F(OtherDatabaseTest, ADatabaseThatCannotBeAskedKnowsNobody) {
-  for (const int error : {EIO, EMFILE, ENOMEM, EINTR}) {
+  for (const int error : {EIO, EINTR}) {
     use([error](passwd* entry, char*, std::size_t, passwd** found) {
       *found = entry;  // whatever else it says
       return error;
@@ -103,12 +117,12 @@ TEST_F(OtherDatabaseTest, AnAccountWithoutAHomeHasNone) {
   EXPECT_EQ(accounts.homeDirectoryOf("keeper"), std::nullopt);
 }
 
-TEST_F(OtherDatabaseTest, WithoutMemoryForALongEntryNobodyIsKnown) {
+TEST_F(OtherDatabaseTest, WithoutMemoryForALongEntryThereIsNoAnswer) {
   if (!FailingAllocations::kWork) GTEST_SKIP() << "operator new belongs to the sanitizer";
   use([](auto... arguments) { return answer(5000, "/home", arguments...); });
   const FailingAllocations noMemory(0);
-  EXPECT_EQ(accounts.idsOf("keeper"), std::nullopt);
-  EXPECT_EQ(accounts.homeDirectoryOf("keeper"), std::nullopt);
+  EXPECT_THROW((void)accounts.idsOf("keeper"), std::bad_alloc);
+  EXPECT_THROW((void)accounts.homeDirectoryOf("keeper"), std::bad_alloc);
 }
 
 }  // namespace

@@ -17,8 +17,10 @@ namespace brenvik {
 // Contacts in memory, which can be made unreachable or failing.
 class InMemoryContacts final : public ContactsService {
  public:
-  std::unique_ptr<ContactsChannelManager> makeChannelManager() noexcept override {
+  std::unique_ptr<ContactsChannelManager> makeChannelManager(bool* lackedMemory = nullptr) noexcept override {
     ++managersAsked;
+    if (lackedMemory != nullptr) *lackedMemory = exhausted;
+    if (exhausted) return nullptr;
     return isReachable ? std::make_unique<Manager>(*this) : nullptr;
   }
 
@@ -29,6 +31,7 @@ class InMemoryContacts final : public ContactsService {
   };
   std::vector<Reference> references;
   bool isReachable = true;
+  bool exhausted = false;  // there is no memory
   std::optional<std::string> failWith;
   int managersAsked = 0;
   std::vector<std::pair<std::string, std::string>> remaps;  // as they were asked for

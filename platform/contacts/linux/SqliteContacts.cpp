@@ -4,6 +4,7 @@
 
 #include <sys/stat.h>
 
+#include <cerrno>
 #include <climits>
 #include <cstdlib>
 #include <new>
@@ -94,6 +95,7 @@ struct Free {
 std::string databasePath(const std::string& home) {
   if (home.empty()) return {};
   const std::unique_ptr<char, Free> resolved(::realpath(home.c_str(), nullptr));
+  if (resolved == nullptr && errno == ENOMEM) throw std::bad_alloc();
   return resolved == nullptr ? std::string() : std::string(resolved.get()) + kBelowHome;
 }
 
@@ -106,44 +108,51 @@ bool isHopeless(int result) noexcept {
     case SQLITE_IOERR:
     case SQLITE_PERM:
     case SQLITE_AUTH:
-    case SQLITE_NOMEM:
       return true;
     default:
       return false;
   }
 }
 
-SqliteDatabase open(const std::string& path) noexcept {
+// Null when there is no database; throws std::bad_alloc when there may be one.
+SqliteDatabase open(const std::string& path) {
   struct stat status {};
   if (path.empty() || ::lstat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) return nullptr;
   // The permission bits say what the owner wants; root obeys them, too.
   if ((status.st_mode & (S_IRUSR | S_IRGRP | S_IROTH)) == 0) return nullptr;
   const bool writable = (status.st_mode & (S_IWUSR | S_IWGRP | S_IWOTH)) != 0;
-  const SqliteFunctions* const sql = sqlite();
+  bool lackedMemory = false;
+  const SqliteFunctions* const sql = sqlite(&lackedMemory);
+  if (lackedMemory) throw std::bad_alloc();
   if (sql == nullptr) return nullptr;
   sqlite3* opened = nullptr;
   const int flags = (writable ? SQLITE_OPEN_READWRITE : SQLITE_OPEN_READONLY) | SQLITE_OPEN_NOFOLLOW |
                     SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_PRIVATECACHE;
   const int result = sql->open_v2(path.c_str(), &opened, flags, nullptr);
   SqliteDatabase database(opened);  // to be closed even when opening failed
+  if (isLackOfMemory(result)) throw std::bad_alloc();
   if (result != SQLITE_OK) return nullptr;
   (void)sql->db_config(opened, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
   (void)sql->db_config(opened, SQLITE_DBCONFIG_TRUSTED_SCHEMA, 0, nullptr);
   // SQLite opens anything and reads nothing; the first pragma that needs the file tells whether it is a
   // database. No waiting here: a locked one is a database.
-  if (isHopeless(sql->exec(opened, "PRAGMA schema_version", nullptr, nullptr, nullptr))) return nullptr;
+  const int version = sql->exec(opened, "PRAGMA schema_version", nullptr, nullptr, nullptr);
+  if (isLackOfMemory(version) || isLackOfMemory(sql->extended_errcode(opened))) throw std::bad_alloc();
+  if (isHopeless(version)) return nullptr;
   (void)sql->exec(opened, "PRAGMA synchronous=FULL; PRAGMA cell_size_check=ON", nullptr, nullptr, nullptr);
   return database;
 }
 
 }  // namespace
 
-std::unique_ptr<ContactsChannelManager> SqliteContacts::makeChannelManager() noexcept {
+std::unique_ptr<ContactsChannelManager> SqliteContacts::makeChannelManager(bool* lackedMemory) noexcept {
+  if (lackedMemory != nullptr) *lackedMemory = false;
   try {
     SqliteDatabase database = open(databasePath(home_()));
     if (database == nullptr) return nullptr;
     return std::make_unique<SqliteChannelManager>(std::move(database), patience_, longestRemap_);
   } catch (const std::bad_alloc&) {
+    if (lackedMemory != nullptr) *lackedMemory = true;
     return nullptr;
   }
 }

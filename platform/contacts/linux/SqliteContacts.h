@@ -30,7 +30,7 @@ class SqliteContacts final : public ContactsService {
       : home_(std::move(home)), patience_(patience), longestRemap_(longestRemap) {}
 
   // Null when there is no home, no database, none that may be read, or a file that is no database.
-  std::unique_ptr<ContactsChannelManager> makeChannelManager() noexcept override;
+  std::unique_ptr<ContactsChannelManager> makeChannelManager(bool* lackedMemory = nullptr) noexcept override;
 
  private:
   const std::function<std::string()> home_;

@@ -6,10 +6,13 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <array>
 #include <atomic>
 #include <cerrno>
 #include <memory>
+#include <new>
 #include <string>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -159,9 +162,43 @@ class Walk {
   SecondThread second_;
 };
 
-}  // namespace
+// The slow way, for when there is no memory: on the stack, a directory after the other, to a depth that a
+// carrier bundle never has.
+constexpr int kDeepestWithoutMemory = 64;
+constexpr int kMostRounds = 16;
 
-int removeTree(int directory, const char* name) {
+int removeWithoutMemory(int above, const char* name, int depth) noexcept {
+  if (::unlinkat(above, name, 0) == 0) return 0;
+  if (errno != EISDIR && errno != EPERM) return errno == ENOENT ? 0 : errno;
+  const UniqueFd directory(::openat(above, name, kOpenFlags));
+  if (!directory.isValid() || depth == kDeepestWithoutMemory) {
+    const int error = directory.isValid() ? ENOMEM : errno;
+    return ::unlinkat(above, name, AT_REMOVEDIR) == 0 ? 0 : error;
+  }
+  int first = 0;
+  alignas(dirent64) std::array<char, 1024> entries;
+  // What is removed while it is listed may hide what follows it from the listing; and somebody may add more.
+  bool isChanged = true;
+  for (int round = 0; round < kMostRounds && std::exchange(isChanged, false); ++round) {
+    first = 0;
+    if (::lseek(directory.get(), 0, SEEK_SET) != 0) return errno;
+    for (ssize_t size = 0; (size = ::getdents64(directory.get(), entries.data(), entries.size())) > 0;) {
+      for (ssize_t at = 0; at < size;) {
+        const auto* const entry = reinterpret_cast<const dirent64*>(entries.data() + at);
+        at += entry->d_reclen;
+        const std::string_view one = entry->d_name;
+        if (one == "." || one == "..") continue;
+        const int error = removeWithoutMemory(directory.get(), entry->d_name, depth + 1);
+        if (error == 0) isChanged = true;
+        if (first == 0) first = error;
+      }
+    }
+  }
+  if (::unlinkat(above, name, AT_REMOVEDIR) == 0) return 0;
+  return first != 0 ? first : errno;
+}
+
+int removeQuickly(int directory, const char* name) {
   if (::unlinkat(directory, name, 0) == 0) return 0;
   // EISDIR is Linux's answer for a directory, EPERM the one of POSIX.
   if (errno != EISDIR && errno != EPERM) return errno;
@@ -173,6 +210,16 @@ int removeTree(int directory, const char* name) {
     return error == ENOTDIR || error == ELOOP ? unlinkError : error;
   }
   return walk.run();
+}
+
+}  // namespace
+
+int removeTree(int directory, const char* name) noexcept {
+  try {
+    return removeQuickly(directory, name);
+  } catch (const std::bad_alloc&) {
+    return removeWithoutMemory(directory, name, 0);
+  }
 }
 
 }  // namespace brenvik

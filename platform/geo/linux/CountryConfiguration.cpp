@@ -97,20 +97,24 @@ void CountryConfiguration::refreshConfiguration() {
     return;
   }
   if (identity_ == identityOf(status)) return;
-  identity_ = identityOf(status);
+  // Known only when it has been read to its end: memory may run out on the way.
+  identity_.reset();
   configured_.reset();
+  Identity identity = identityOf(status);
   errno = 0;
   const auto content = readFile(files_.configuration, &status);
   if (!content && (errno == EMFILE || errno == ENFILE || errno == ENOMEM)) {
-    // The want is ours and passes; the file is read when it is asked for next.
-    identity_.reset();
-    return;
+    return;  // the want is ours and passes; the file is read when it is asked for next
   }
   if (content) {
-    identity_ = identityOf(status);
-    const PropertyList value = parsePropertyList(std::as_bytes(std::span(*content))).find("CountryCode");
+    identity = identityOf(status);
+    CodecFailure failure{};
+    const PropertyList file = parsePropertyList(std::as_bytes(std::span(*content)), &failure);
+    if (failure == CodecFailure::noMemory) throw std::bad_alloc();
+    const PropertyList value = file.find("CountryCode");
     if (const auto code = value.asString(); code && !code->empty()) configured_ = *code;
   }
+  identity_ = identity;
   if (!configured_)
     logUnified(LogLevel::error, "geo service: the country configuration names no country code");
 }
@@ -127,17 +131,19 @@ std::optional<std::string> CountryConfiguration::countryOfTimeZone() {
     return countryOfZone(*name);
   }
   if (target == zoneLink_) return zoneCountry_;
-  zoneLink_ = target;
-  zoneCountry_.reset();
+  const auto link = target;
+  std::optional<std::string> country;
   // Step by step: zones of two countries may be links to one file, and the first name is the one that was
   // chosen.
-  for (int links = 0; target && links < kMostLinks && !zoneCountry_; ++links) {
+  for (int links = 0; target && links < kMostLinks && !country; ++links) {
     path = target->starts_with('/') ? *target : path.substr(0, path.rfind('/') + 1) + *target;
     // A relative alias climbs within the database: its name is what is left of the detour.
     path = std::filesystem::path(path).lexically_normal();
-    if (const auto zone = zoneNameIn(path)) zoneCountry_ = countryOfZone(*zone);
+    if (const auto zone = zoneNameIn(path)) country = countryOfZone(*zone);
     target = readLink(path);
   }
+  zoneLink_ = link;
+  zoneCountry_ = std::move(country);
   return zoneCountry_;
 }
 

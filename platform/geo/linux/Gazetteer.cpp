@@ -159,10 +159,10 @@ Gazetteer::Answer Gazetteer::lookUp(Coordinate coordinate) {
 }
 
 void Gazetteer::finish(Query& statement, int code) {
+  if (code == SQLITE_ROW || code == SQLITE_DONE) code = statement.failure();
+  if (code == SQLITE_OK || failure_) return;
   // The text is that of the latest call, whatever it came to.
-  if (code != SQLITE_ROW && code != SQLITE_DONE && !failure_)
-    failure_ = sqlite()->errmsg(opened_->database.get());
-  statement.reset();
+  failure_ = isLackOfMemory(code) ? sqlite()->errstr(code) : sqlite()->errmsg(opened_->database.get());
 }
 
 // Borders meet the antimeridian from one side or the other, and the pole from one: a position on the edge of
@@ -177,6 +177,7 @@ std::optional<std::string> Gazetteer::countryAround(Position position) {
 std::optional<std::string> Gazetteer::countryAt(Position position) {
   // A region is an area with holes: inside an odd number of its rings is inside. Regions do not overlap.
   std::map<std::int64_t, std::pair<bool, std::string>> regions;
+  const Query::Run run(opened_->rings);
   opened_->rings.bind(1, position.lng);
   opened_->rings.bind(2, position.lat);
   int code = opened_->rings.step();
@@ -230,6 +231,7 @@ std::optional<Gazetteer::Place> Gazetteer::nearestPlace(Position position, const
 void Gazetteer::searchBox(Position position, const std::string* country, std::int64_t west, std::int64_t east,
                           std::int64_t south, std::int64_t north, std::optional<Place>& nearest) {
   Query& statement = country != nullptr ? opened_->placesOfCountry : opened_->places;
+  const Query::Run run(statement);
   statement.bind(1, west);
   statement.bind(2, east);
   statement.bind(3, south);
@@ -249,6 +251,7 @@ void Gazetteer::searchBox(Position position, const std::string* country, std::in
 }
 
 std::optional<std::string> Gazetteer::areaName(std::int64_t area) {
+  const Query::Run run(opened_->area);
   opened_->area.bind(1, area);
   std::optional<std::string> name;
   const int code = opened_->area.step();

@@ -9,6 +9,7 @@
 #include <cstring>
 #include <memory>
 #include <mutex>
+#include <new>
 #include <system_error>
 #include <thread>
 #include <utility>
@@ -64,10 +65,12 @@ std::shared_ptr<LookUp> startOrJoin(const HostAndPort& server) {
   if (!lookUp->finished.isValid()) return nullptr;
   try {
     std::thread([lookUp] {
-      auto found = addressesOf(lookUp->server, 0);
-      {
+      try {
+        auto found = addressesOf(lookUp->server, 0);
         const std::lock_guard resultLock(lookUp->mutex);
         lookUp->found = std::move(found);
+      } catch (const std::bad_alloc&) {
+        // Found nothing.
       }
       lookUp->done.store(true);
       (void)::eventfd_write(lookUp->finished.get(), 1);  // its count is far from full

@@ -5,12 +5,14 @@
 #include <sys/eventfd.h>
 #include <sys/random.h>
 
+#include <new>
 #include <utility>
 
 namespace brenvik {
 namespace {
 
 constexpr const char* kNoThread = "no thread to wait on";
+constexpr const char* kNoMemory = "out of memory";
 
 }  // namespace
 
@@ -32,7 +34,7 @@ void PublicAddressFinder::find(Deliver deliver, WorkQueue& queue) {
     queue.post([weak = weak_from_this()] {
       if (const auto self = weak.lock()) self->runTransaction();
     });
-  } catch (const OutOfQueues&) {
+  } catch (const std::bad_alloc&) {  // of memory, or of threads
     // Nobody is left waiting for a transaction that will not run: the next question has to post one.
     std::vector<Deliver> asked;
     {
@@ -59,12 +61,23 @@ void PublicAddressFinder::runTransaction() {
     if (stopped_) return;
     asked.swap(waiting_);
   }
-  const StunOutcome found = outcome();
+  StunOutcome found;
+  try {
+    found = outcome();
+  } catch (const std::bad_alloc&) {
+    found = {{}, GeoError{kNoMemory}};
+  }
   {
     const std::lock_guard lock(mutex_);
     if (stopped_) return;
   }
-  for (const auto& deliver : asked) deliver(found);
+  for (const auto& deliver : asked) {
+    try {
+      deliver(found);
+    } catch (const std::bad_alloc&) {
+      // Whoever asked has a time-out; the others are to be told all the same.
+    }
+  }
 }
 
 StunOutcome PublicAddressFinder::outcome() {

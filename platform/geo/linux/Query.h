@@ -16,6 +16,18 @@ namespace brenvik {
 // SQLite's. It must not outlive its database.
 class Query {
  public:
+  // Makes a statement ready to run again when the scope is left, by an exception, too.
+  class Run {
+   public:
+    explicit Run(Query& query) noexcept : query_(query) {}
+    ~Run() { query_.reset(); }
+    Run(const Run&) = delete;
+    Run& operator=(const Run&) = delete;
+
+   private:
+    Query& query_;
+  };
+
   Query() = default;
   // Not valid when SQLite refuses the text.
   Query(const SqliteFunctions& functions, sqlite3* database, std::string_view sql) noexcept
@@ -28,25 +40,31 @@ class Query {
 
   bool isValid() const noexcept { return statement_ != nullptr; }
   void bind(int parameter, std::int64_t value) noexcept {
-    (void)sqlite_->bind_int64(statement_.get(), parameter, value);
+    note(sqlite_->bind_int64(statement_.get(), parameter, value));
   }
-  // The text is copied.
+  // The text must stay until the statement is reset.
   void bind(int parameter, std::string_view value) noexcept {
-    (void)sqlite_->bind_text(statement_.get(), parameter, value.data(), static_cast<int>(value.size()),
-                             SQLITE_TRANSIENT);
+    note(sqlite_->bind_text(statement_.get(), parameter, value.data(), static_cast<int>(value.size()),
+                            SQLITE_STATIC));
   }
-  // SQLITE_ROW, SQLITE_DONE or an error.
-  int step() noexcept { return sqlite_->step(statement_.get()); }
+  // SQLITE_ROW, SQLITE_DONE or an error; of a binding or a text that failed, too.
+  int step() noexcept { return failure_ != SQLITE_OK ? failure_ : sqlite_->step(statement_.get()); }
+  // Of a binding, or of a text of the last row. SQLITE_OK: none.
+  int failure() const noexcept { return failure_; }
   // Makes it ready to run again; the bindings stay.
-  void reset() noexcept { (void)sqlite_->reset(statement_.get()); }
+  void reset() noexcept {
+    (void)sqlite_->reset(statement_.get());
+    failure_ = SQLITE_OK;
+  }
 
   // Of the present row; views hold until the next step or reset.
   bool isNull(int column) const noexcept {
     return sqlite_->column_type(statement_.get(), column) == SQLITE_NULL;
   }
   std::int64_t integer(int column) const noexcept { return sqlite_->column_int64(statement_.get(), column); }
-  std::string_view text(int column) const noexcept {
+  std::string_view text(int column) noexcept {
     const auto* bytes = reinterpret_cast<const char*>(sqlite_->column_text(statement_.get(), column));
+    if (bytes == nullptr && !isNull(column)) note(SQLITE_NOMEM);
     return {bytes, bytes == nullptr ? 0 : size(column)};
   }
   std::span<const std::byte> blob(int column) const noexcept {
@@ -55,11 +73,15 @@ class Query {
   }
 
  private:
+  void note(int code) noexcept {
+    if (failure_ == SQLITE_OK) failure_ = code;
+  }
   std::size_t size(int column) const noexcept {
     return static_cast<std::size_t>(sqlite_->column_bytes(statement_.get(), column));
   }
   const SqliteFunctions* sqlite_ = nullptr;
   SqliteStatement statement_;
+  int failure_ = SQLITE_OK;
 };
 
 }  // namespace brenvik

@@ -67,25 +67,25 @@ IncomingMessage::Received IncomingMessage::receive(int fd) noexcept {
   return Received::message;
 }
 
-bool IncomingMessage::mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept {
+KernelReturn IncomingMessage::mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept {
   const int seals = ::fcntl(fd, F_GET_SEALS);
-  if (seals < 0 || (seals & kNeededSeals) != kNeededSeals) return false;
+  if (seals < 0 || (seals & kNeededSeals) != kNeededSeals) return mig::badArguments;
   struct stat status {};
   (void)::fstat(fd, &status);  // a descriptor with seals has a size
-  if (status.st_size < static_cast<off_t>(length)) return false;
+  if (status.st_size < static_cast<off_t>(length)) return mig::badArguments;
   // Private: before Linux 6.7 a shared mapping of memory sealed against writing is refused, even for reading.
   void* const mapped = ::mmap(nullptr, length, PROT_READ, MAP_PRIVATE, fd, 0);
-  if (mapped == MAP_FAILED) return false;
+  if (mapped == MAP_FAILED) return kern::resourceShortage;
   mappings_[mappingCount_++] = {mapped, length};
   *address = reinterpret_cast<std::uint64_t>(mapped);
-  return true;
+  return kern::success;
 }
 
-bool IncomingMessage::unpack(PortName localPort) noexcept {
-  if (truncated_) return false;
+KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
+  if (truncated_) return mig::badArguments;
   const std::span<const std::byte> datagram(storage_.bytes.data(), length_);
   const auto walk = walkDescriptors(datagram);
-  if (!walk || walk->rights != fdCount_) return false;
+  if (!walk || walk->rights != fdCount_) return mig::badArguments;
 
   std::size_t nextFd = 0;
   DescriptorCursor cursor(datagram, walk->messageSize);
@@ -93,9 +93,9 @@ bool IncomingMessage::unpack(PortName localPort) noexcept {
     std::byte* const at = storage_.bytes.data() + descriptor->offset;
     if (descriptor->kind == WalkedDescriptor::Kind::port) {
       UniqueFd& fd = fds_[nextFd++];
-      if (!isPortSocket(fd.get())) return false;
+      if (!isPortSocket(fd.get())) return mig::badArguments;
       const PortName name = ports_.adoptSendRight(std::move(fd));
-      if (name == kNullPort) return false;
+      if (name == kNullPort) return kern::resourceShortage;
       names_[nameCount_++] = name;
       std::memcpy(at + offsetof(PortDescriptor, name), &name, sizeof name);
       continue;
@@ -104,14 +104,15 @@ bool IncomingMessage::unpack(PortName localPort) noexcept {
     if (descriptor->kind == WalkedDescriptor::Kind::inLineRegion) {
       address = reinterpret_cast<std::uint64_t>(storage_.bytes.data() + descriptor->regionOffset);
     } else if (descriptor->kind == WalkedDescriptor::Kind::memfdRegion) {
-      if (!mapRegion(fds_[nextFd++].get(), descriptor->regionLength, &address)) return false;
+      const KernelReturn code = mapRegion(fds_[nextFd++].get(), descriptor->regionLength, &address);
+      if (code != kern::success) return code;
     }
     std::memcpy(at + offsetof(OutOfLineDescriptor, address), &address, sizeof address);
   }
   auto& header = *reinterpret_cast<MessageHeader*>(storage_.bytes.data());
   header.size = walk->messageSize;
   header.localPort = localPort;
-  return true;
+  return kern::success;
 }
 
 void IncomingMessage::release(bool keepRights) noexcept {

@@ -33,9 +33,10 @@ class IncomingMessage {
   bool hasHeader() const noexcept { return length_ >= sizeof(MessageHeader); }
 
   // Checks the framing, maps what travels as a memfd, gives names to the rights and writes both into the
-  // message, with its size and `localPort`. False when no correct sender makes such a datagram; the header is
-  // as sent then. Precondition: hasHeader().
-  bool unpack(PortName localPort) noexcept;
+  // message, with its size and `localPort`. A code of the message layer when no correct sender makes such a
+  // datagram, one of the kernel when this process lacks what it takes; the header is as sent then.
+  // Precondition: hasHeader().
+  KernelReturn unpack(PortName localPort) noexcept;
 
   // The message, after unpack(); 8-byte aligned.
   std::byte* bytes() noexcept { return storage_.bytes.data(); }
@@ -58,7 +59,7 @@ class IncomingMessage {
     void* address;
     std::size_t length;
   };
-  bool mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept;
+  KernelReturn mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept;
 
   SystemPortSpace& ports_;
   std::size_t length_ = 0;

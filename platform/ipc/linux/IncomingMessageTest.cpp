@@ -75,7 +75,7 @@ TEST_F(IncomingMessageTest, ControlDataThatNobodyKnowsIsPassedOver) {
   ASSERT_EQ(::setsockopt(ours.get(), SOL_SOCKET, SO_TIMESTAMP, &on, sizeof on), 0);
   send(kRight, theirs.get());
   ASSERT_EQ(incoming.receive(ours.get()), Received::message);
-  EXPECT_TRUE(incoming.unpack(5));
+  EXPECT_EQ(incoming.unpack(5), kern::success);
   EXPECT_EQ(ports.size(), 1U);
   EXPECT_FALSE(incoming.sender());
 }
@@ -89,12 +89,12 @@ TEST_F(IncomingMessageTest, ARegionThatCannotBeMappedRefusesTheMessage) {
   ASSERT_EQ(incoming.receive(ours.get()), Received::message);
   {
     const FailingCall noRoom("mmap", ENOMEM);
-    EXPECT_FALSE(incoming.unpack(5));
+    EXPECT_EQ(incoming.unpack(5), kern::resourceShortage);
     EXPECT_EQ(noRoom.failures(), 1);
   }
   send(region, memfd.get());
   ASSERT_EQ(incoming.receive(ours.get()), Received::message);
-  EXPECT_TRUE(incoming.unpack(5)) << "the next one is served";
+  EXPECT_EQ(incoming.unpack(5), kern::success) << "the next one is served";
 }
 
 TEST_F(IncomingMessageTest, ARightThatThereIsNoMemoryForRefusesTheMessageAndLeavesNothing) {
@@ -103,12 +103,13 @@ TEST_F(IncomingMessageTest, ARightThatThereIsNoMemoryForRefusesTheMessageAndLeav
   for (long first = 0;; ++first) {
     send(kRight, theirs.get());
     ASSERT_EQ(incoming.receive(ours.get()), Received::message);
-    bool unpacked = false;
+    KernelReturn unpacked = kern::failure;
     {
       const FailingAllocations noMemory(first);
       unpacked = incoming.unpack(5);
     }
-    if (unpacked) break;
+    if (unpacked == kern::success) break;
+    EXPECT_EQ(unpacked, kern::resourceShortage);
     ++refused;
     EXPECT_EQ(ports.size(), 0U);
   }

@@ -190,16 +190,17 @@ class Channel : public std::enable_shared_from_this<Channel> {
 void Channel::serve() noexcept {
   if (!incoming_.hasHeader()) return incoming_.release(false);  // dropped without an answer
 
-  const bool wellFormed = incoming_.unpack(owner_->port());
+  const KernelReturn unpacked = incoming_.unpack(owner_->port());
   const MessageHeader request = incoming_.header();
   OutgoingReply out;
   std::memset(out.bytes.data(), 0, kRequestLargestReply);
   Reply reply(out.bytes.data());
   Outcome outcome = Outcome::refused;
 
-  const RoutineTable::Handler handler = wellFormed ? owner_->table().find(request.id) : nullptr;
-  if (!wellFormed) {
-    reply.setStatus(mig::badArguments);
+  const RoutineTable::Handler handler =
+      unpacked == kern::success ? owner_->table().find(request.id) : nullptr;
+  if (unpacked != kern::success) {
+    reply.setStatus(unpacked);
   } else if (handler == nullptr) {
     reply.setStatus(mig::badId);
   } else if (owner_->wantTrailer() == WantTrailer::yes && incoming_.sender() &&

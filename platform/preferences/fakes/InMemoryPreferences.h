@@ -63,22 +63,28 @@ class InMemoryPreferences final : public PreferencesStore {
 
   InMemoryDisk& disk() noexcept { return *disk_; }
 
-  void setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
+  bool setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
                 HostScope host) noexcept override {
     if (!namesPreferencesFile(domain)) {
       logUnified(LogLevel::error, "Preferences: domain \"%.*s\" names no file, nothing is stored",
                  static_cast<int>(domain.size()), domain.data());
-      return;
+      return true;
     }
+    if (runsOutOfMemory()) return false;
     const std::lock_guard lock(mutex_);
     domains_[{std::string(domain), user, host}].pending.insert_or_assign(std::string(key), value);
+    return true;
   }
 
-  bool synchronize(std::string_view domain, UserScope user, HostScope host) noexcept override {
-    if (!namesPreferencesFile(domain)) return false;
+  Synchronized synchronize(std::string_view domain, UserScope user, HostScope host) noexcept override {
+    if (!namesPreferencesFile(domain)) return Synchronized::notWhole();
     const std::lock_guard lock(mutex_);
     const InMemoryDisk::DomainName name{std::string(domain), user, host};
     Cached& cached = domains_[name];
+    if (runsOutOfMemory()) {
+      cached.pending.clear();
+      return Synchronized::withoutMemory();
+    }
     auto pending = std::exchange(cached.pending, {});
     const bool isSound =
         std::erase_if(pending, [](const auto& one) { return !canBeStored(one.first, one.second); }) == 0;
@@ -87,32 +93,43 @@ class InMemoryPreferences final : public PreferencesStore {
     if (!isStored) logUnified(LogLevel::error, "Preferences: the disk is full");
     cached.values = disk_->read(name);
     cached.isLoaded = true;
-    return isStored && isSound;
+    return isStored && isSound ? Synchronized::whole() : Synchronized::notWhole();
   }
 
-  PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
-                         HostScope host) noexcept override {
-    if (!namesPreferencesFile(domain)) return {};
+  bool readValue(std::string_view key, std::string_view domain, UserScope user, HostScope host,
+                 PropertyList* value) noexcept override {
+    *value = {};
+    if (!namesPreferencesFile(domain)) return true;
+    if (runsOutOfMemory()) return false;
     const std::lock_guard lock(mutex_);
     const InMemoryDisk::DomainName name{std::string(domain), user, host};
     Cached& cached = domains_[name];
-    if (const auto set = cached.pending.find(key); set != cached.pending.end()) return set->second;
+    if (const auto set = cached.pending.find(key); set != cached.pending.end()) {
+      *value = set->second;
+      return true;
+    }
     if (!std::exchange(cached.isLoaded, true)) cached.values = disk_->read(name);
     const auto found = cached.values.find(key);
-    return found != cached.values.end() ? found->second : PropertyList();
+    if (found != cached.values.end()) *value = found->second;
+    return true;
   }
 
-  bool synchronizeApplication(std::string_view domain) noexcept override {
-    bool isWhole = true;
-    for (const auto [user, host] : kApplicationScopes) isWhole = synchronize(domain, user, host) && isWhole;
-    return isWhole;
-  }
-
-  PropertyList copyApplicationValue(std::string_view key, std::string_view domain) noexcept override {
+  Synchronized synchronizeApplication(std::string_view domain) noexcept override {
+    Synchronized all = Synchronized::whole();
     for (const auto [user, host] : kApplicationScopes) {
-      if (PropertyList value = copyValue(key, domain, user, host)) return value;
+      const Synchronized one = synchronize(domain, user, host);
+      if (!one && !all.lackedMemory()) all = one;
     }
-    return {};
+    return all;
+  }
+
+  bool readApplicationValue(std::string_view key, std::string_view domain,
+                            PropertyList* value) noexcept override {
+    for (const auto [user, host] : kApplicationScopes) {
+      if (!readValue(key, domain, user, host, value)) return false;
+      if (*value) return true;
+    }
+    return true;
   }
 
   void flushCachesForAnyUser(const std::string* domain) noexcept override {
@@ -130,12 +147,22 @@ class InMemoryPreferences final : public PreferencesStore {
   // test.
   std::vector<std::optional<std::string>> flushes;
 
+  // How many more operations on a domain with a file find memory; negative: all do. Main thread of a test.
+  int operationsWithMemory = -1;
+
  private:
   struct Cached {
     InMemoryDisk::Values pending;
     InMemoryDisk::Values values;
     bool isLoaded = false;
   };
+
+  bool runsOutOfMemory() noexcept {
+    if (operationsWithMemory < 0) return false;
+    if (operationsWithMemory == 0) return true;
+    --operationsWithMemory;
+    return false;
+  }
 
   // A domain is a dictionary, so a value may be a level less deep than a document.
   static bool canBeStored(const std::string& key, const PropertyList& value) {

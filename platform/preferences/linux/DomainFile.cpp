@@ -53,16 +53,11 @@ bool isPassing(int error) noexcept {
   return error == EMFILE || error == ENFILE || error == ENOMEM || error == EINTR || error == EAGAIN;
 }
 
-// Whether there is room for a tree of a document of this size.
-bool hasMemoryFor(std::size_t documentSize) noexcept {
-  void* volatile probe = std::malloc(documentSize * 16 + (std::size_t{1} << 20));  // volatile: do not skip it
-  std::free(probe);
-  return probe != nullptr;
-}
-
 // What is wrong with a domain's file, or null and its content.
 const char* parse(std::string_view bytes, DomainImage& image) {
-  const PropertyList document = parsePropertyList(std::as_bytes(std::span(bytes)));
+  CodecFailure failure{};
+  const PropertyList document = parsePropertyList(std::as_bytes(std::span(bytes)), &failure);
+  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
   if (!document) return "not a property list";
   if (!document.is(PropertyList::Type::dictionary)) return "not a dictionary";
   auto found = DomainImage::of(document);
@@ -194,12 +189,8 @@ DomainFile::Attempt DomainFile::tryLoad() const {
     if (::fstat(loaded.pin.get(), &facts) != 0) return passing(errno);
     if (stampOf(facts) == loaded.stamp || round == kReadAttempts) break;
   }
-  const char* damage = parse(bytes, loaded.image);
-  // The codec says the same of a malformed document and of a lack of memory. A good file is not to be moved
-  // aside for the latter: there must be room, and a second look must give the same.
-  if (damage != nullptr && !hasMemoryFor(bytes.size())) return passing(ENOMEM);
-  if (damage != nullptr) damage = parse(bytes, loaded.image);
-  if (damage != nullptr) return damaged(damage);
+  // A lack of memory leaves by an exception: a good file is not to be moved aside for it.
+  if (const char* const damage = parse(bytes, loaded.image); damage != nullptr) return damaged(damage);
   loaded.state = State::read;
   timespec now{};
   ::clock_gettime(CLOCK_REALTIME, &now);

@@ -3,6 +3,7 @@
 #include "platform/preferences/linux/DomainImage.h"
 
 #include <algorithm>
+#include <new>
 #include <span>
 #include <utility>
 
@@ -69,8 +70,18 @@ void appendTrailer(std::string& out, std::size_t offsetWidth, std::size_t refere
   out.append(trailer, sizeof trailer);
 }
 
-PropertyList parse(std::string_view bytes) noexcept {
-  return parsePropertyList(std::as_bytes(std::span(bytes)));
+// The codec's answers, with a lack of memory thrown.
+PropertyList parse(std::string_view bytes) {
+  CodecFailure failure{};
+  PropertyList value = parsePropertyList(std::as_bytes(std::span(bytes)), &failure);
+  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
+  return value;
+}
+std::optional<std::string> serialize(const PropertyList& value) {
+  CodecFailure failure{};
+  auto bytes = serializePropertyList(value, PropertyListFormat::binary, &failure);
+  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
+  return bytes;
 }
 
 // Adds `by` to every reference of the containers that stand at these offsets.
@@ -91,7 +102,7 @@ void shiftReferences(char* bytes, std::size_t size, std::span<const std::uint32_
 std::optional<DomainImage> DomainImage::of(const PropertyList& dictionary) {
   if (!dictionary.is(PropertyList::Type::dictionary)) return std::nullopt;
   // Written by our own codec, whatever file it came from: one form to take apart, checked already.
-  const auto bytes = serializePropertyList(dictionary, PropertyListFormat::binary);
+  const auto bytes = serialize(dictionary);
   if (!bytes) return std::nullopt;
   const auto document = bplist::Document::open(*bytes);
   if (!document) return std::nullopt;
@@ -166,7 +177,7 @@ DomainImage::Change DomainImage::set(std::string_view key, const PropertyList& v
     return Change::made;
   }
 
-  const auto bytes = serializePropertyList(value, PropertyListFormat::binary);
+  const auto bytes = serialize(value);
   if (!bytes) return Change::refused;
   const auto document = bplist::Document::open(*bytes);
   if (!document) return Change::refused;

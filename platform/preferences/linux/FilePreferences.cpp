@@ -35,9 +35,13 @@ std::string homeOfEffectiveUser() {
   passwd entry{};
   passwd* found = nullptr;
   int error = 0;
+  errno = 0;
   while ((error = ::getpwuid_r(::geteuid(), &entry, buffer.data(), buffer.size(), &found)) == ERANGE) {
     buffer.resize(buffer.size() * 2);
+    errno = 0;
   }
+  // A look-up that lacked memory may say that there is no such account; errno keeps the truth.
+  if (found == nullptr && (error == ENOMEM || errno == ENOMEM)) throw std::bad_alloc();
   return error == 0 && found != nullptr && found->pw_dir != nullptr ? found->pw_dir : "";
 }
 
@@ -57,11 +61,14 @@ std::string machineId() {
 // One domain in one scope: its file as last seen, and what was set since.
 class FilePreferences::Domain {
  public:
-  Domain(DomainPlace place, std::string name, std::chrono::milliseconds patience)
-      : name_(std::move(name)), file_(std::move(place)), patience_(patience) {}
+  Domain(DomainPlace place, std::string name, PreferencesScope scope, std::chrono::milliseconds patience)
+      : name_(std::move(name)), scope_(scope), file_(std::move(place)), patience_(patience) {}
 
   const std::string& name() const noexcept { return name_; }
   const std::string& path() const noexcept { return file_.path(); }
+  bool is(std::string_view name, UserScope user, HostScope host) const noexcept {
+    return name_ == name && scope_.user == user && scope_.host == host;
+  }
 
   void setValue(std::string_view key, const PropertyList& value) {
     const std::lock_guard lock(mutex_);
@@ -161,6 +168,7 @@ class FilePreferences::Domain {
   }
 
   const std::string name_;
+  const PreferencesScope scope_;
   DomainFile file_;
   const std::chrono::milliseconds patience_;
 
@@ -209,15 +217,14 @@ std::optional<DomainPlace> FilePreferences::placeOf(std::string_view domain, Use
 std::shared_ptr<FilePreferences::Domain> FilePreferences::find(std::string_view domain, UserScope user,
                                                                HostScope host) {
   const std::lock_guard lock(mutex_);
-  auto place = placeOf(domain, user, host);
-  if (!place) return nullptr;
-  const std::string path = place->path();
   const auto known = std::find_if(domains_.begin(), domains_.end(),
-                                  [&path](const auto& one) { return one->path() == path; });
+                                  [&](const auto& one) { return one->is(domain, user, host); });
   if (known != domains_.end()) {
     domains_.splice(domains_.begin(), domains_, known);
     return domains_.front();
   }
+  auto place = placeOf(domain, user, host);
+  if (!place) return nullptr;
   std::size_t count = 0;
   std::size_t bytes = 0;
   for (auto one = domains_.begin(); one != domains_.end();) {
@@ -226,61 +233,68 @@ std::shared_ptr<FilePreferences::Domain> FilePreferences::find(std::string_view 
     bytes += weight.value_or(0);
     one = weight && (count >= kMostDomains || bytes > kMostKeptBytes) ? domains_.erase(one) : std::next(one);
   }
-  domains_.push_front(std::make_shared<Domain>(std::move(*place), std::string(domain), patience_));
+  domains_.push_front(std::make_shared<Domain>(std::move(*place), std::string(domain),
+                                               PreferencesScope{user, host}, patience_));
   return domains_.front();
 }
 
-void FilePreferences::setValue(std::string_view key, const PropertyList& value, std::string_view domain,
+bool FilePreferences::setValue(std::string_view key, const PropertyList& value, std::string_view domain,
                                UserScope user, HostScope host) noexcept {
   try {
-    if (const auto found = find(domain, user, host)) return found->setValue(key, value);
-    logUnified(LogLevel::error, "Preferences: domain \"%.*s\" names no file, nothing is stored",
-               static_cast<int>(domain.size()), domain.data());
+    if (const auto found = find(domain, user, host)) {
+      found->setValue(key, value);
+    } else {
+      logUnified(LogLevel::error, "Preferences: domain \"%.*s\" names no file, nothing is stored",
+                 static_cast<int>(domain.size()), domain.data());
+    }
+    return true;
   } catch (const std::bad_alloc&) {
-    hasLostValue_ = true;
     logUnified(LogLevel::error, "Preferences: no memory to set a value");
-  }
-}
-
-bool FilePreferences::synchronize(std::string_view domain, UserScope user, HostScope host) noexcept {
-  const bool isWhole = !hasLostValue_.exchange(false);
-  try {
-    const auto found = find(domain, user, host);
-    return found != nullptr && found->synchronize() && isWhole;
-  } catch (const std::bad_alloc&) {
-    logUnified(LogLevel::error, "Preferences: no memory to store a domain");
     return false;
   }
 }
 
-PropertyList FilePreferences::copyValue(std::string_view key, std::string_view domain, UserScope user,
-                                        HostScope host) noexcept {
+Synchronized FilePreferences::synchronize(std::string_view domain, UserScope user, HostScope host) noexcept {
   try {
     const auto found = find(domain, user, host);
-    return found != nullptr ? found->copyValue(key) : PropertyList();
+    return found != nullptr && found->synchronize() ? Synchronized::whole() : Synchronized::notWhole();
   } catch (const std::bad_alloc&) {
-    return {};
+    logUnified(LogLevel::error, "Preferences: no memory to store a domain");
+    return Synchronized::withoutMemory();
   }
 }
 
-bool FilePreferences::synchronizeApplication(std::string_view domain) noexcept {
-  bool isWhole = !hasLostValue_.exchange(false) && namesPreferencesFile(domain);
+bool FilePreferences::readValue(std::string_view key, std::string_view domain, UserScope user, HostScope host,
+                                PropertyList* value) noexcept {
+  try {
+    const auto found = find(domain, user, host);
+    *value = found != nullptr ? found->copyValue(key) : PropertyList();
+    return true;
+  } catch (const std::bad_alloc&) {
+    return false;
+  }
+}
+
+Synchronized FilePreferences::synchronizeApplication(std::string_view domain) noexcept {
+  bool isWhole = namesPreferencesFile(domain);
   try {
     for (const auto [user, host] : kApplicationScopes) {
       if (const auto found = find(domain, user, host)) isWhole = found->synchronize() && isWhole;
     }
   } catch (const std::bad_alloc&) {
     logUnified(LogLevel::error, "Preferences: no memory to store a domain");
-    return false;
+    return Synchronized::withoutMemory();
   }
-  return isWhole;
+  return isWhole ? Synchronized::whole() : Synchronized::notWhole();
 }
 
-PropertyList FilePreferences::copyApplicationValue(std::string_view key, std::string_view domain) noexcept {
+bool FilePreferences::readApplicationValue(std::string_view key, std::string_view domain,
+                                           PropertyList* value) noexcept {
   for (const auto [user, host] : kApplicationScopes) {
-    if (PropertyList value = copyValue(key, domain, user, host)) return value;
+    if (!readValue(key, domain, user, host, value)) return false;
+    if (*value) return true;
   }
-  return {};
+  return true;
 }
 
 void FilePreferences::flushCachesForAnyUser(const std::string* domain) noexcept {

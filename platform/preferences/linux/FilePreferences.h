@@ -2,7 +2,6 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
-#include <atomic>
 #include <chrono>
 #include <functional>
 #include <list>
@@ -49,26 +48,26 @@ class FilePreferences final : public PreferencesStore {
   FilePreferences& operator=(const FilePreferences&) = delete;
   ~FilePreferences() override;
 
-  void setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
+  bool setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
                 HostScope host) noexcept override;
-  bool synchronize(std::string_view domain, UserScope user, HostScope host) noexcept override;
-  PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
-                         HostScope host) noexcept override;
-  bool synchronizeApplication(std::string_view domain) noexcept override;
-  PropertyList copyApplicationValue(std::string_view key, std::string_view domain) noexcept override;
+  Synchronized synchronize(std::string_view domain, UserScope user, HostScope host) noexcept override;
+  bool readValue(std::string_view key, std::string_view domain, UserScope user, HostScope host,
+                 PropertyList* value) noexcept override;
+  Synchronized synchronizeApplication(std::string_view domain) noexcept override;
+  bool readApplicationValue(std::string_view key, std::string_view domain,
+                            PropertyList* value) noexcept override;
   void flushCachesForAnyUser(const std::string* domain) noexcept override;
 
  private:
   class Domain;
 
   std::optional<DomainPlace> placeOf(std::string_view domain, UserScope user, HostScope host);
-  // Null when the domain names no file there. May throw std::bad_alloc.
+  // Null when the domain names no file there. May throw std::bad_alloc, but not for a domain that is known:
+  // what was set there can always be stored or dropped.
   std::shared_ptr<Domain> find(std::string_view domain, UserScope user, HostScope host);
 
   const std::function<Places()> askForPlaces_;
   const std::chrono::milliseconds patience_;
-  // There was no memory to keep a value that was set; whichever synchronize() comes next says so.
-  std::atomic<bool> hasLostValue_ = false;
   std::mutex mutex_;  // of what follows; never held while a domain works
   std::optional<Places> places_;
   std::list<std::shared_ptr<Domain>> domains_;  // last used first

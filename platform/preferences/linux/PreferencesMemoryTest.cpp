@@ -114,9 +114,9 @@ TEST_P(PreferencesMemoryTest, ASetIsStoredWholeOrNotAnsweredAndAGoodFileStaysInI
           }
         },
         [&] {
-          store->setValue("key", value, kDomain, kUser, kHost);
-          store->setValue("another", value, kDomain, kUser, kHost);
-          return store->synchronize(kDomain, kUser, kHost);
+          const bool isKept = store->setValue("key", value, kDomain, kUser, kHost);
+          return store->setValue("another", value, kDomain, kUser, kHost) & isKept &
+                 bool{store->synchronize(kDomain, kUser, kHost)};
         });
     // And when there is memory again, all is well.
     store->setValue("key", value, kDomain, kUser, kHost);

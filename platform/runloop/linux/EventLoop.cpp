@@ -15,6 +15,8 @@
 #include <new>
 #include <utility>
 
+#include "platform/log/Log.h"
+
 namespace brenvik {
 namespace {
 
@@ -40,6 +42,17 @@ std::uint64_t toMicroseconds(std::chrono::nanoseconds time) noexcept {
   return time.count() <= 0 ? 0 : (static_cast<std::uint64_t>(time.count()) + 999U) / 1'000U;
 }
 
+// Runs what a task or a source brought along. One that lacks memory and has not coped with that itself is
+// given up; whatever else waits has its turn.
+template <typename Work>
+void run(const Work& work) noexcept {
+  try {
+    work();
+  } catch (const std::bad_alloc&) {
+    logUnified(LogLevel::error, "A task was given up: out of memory");
+  }
+}
+
 }  // namespace
 
 struct EventLoop::Timer {
@@ -62,10 +75,11 @@ class EventLoop::TimerHandle final : public LoopSource {
     if (!timer_->valid.exchange(false)) return;
     const auto loop = loop_.lock();
     if (loop == nullptr) return;
-    if (loop->onLoopThread()) {
-      loop->disarm(*timer_);
-    } else {
+    if (loop->onLoopThread()) return loop->disarm(*timer_);
+    try {
       loop->post([timer = timer_] { timer->loop->disarm(*timer); });
+    } catch (const std::bad_alloc&) {
+      // It goes when it is due.
     }
   }
 
@@ -96,9 +110,9 @@ class EventLoop::DescriptorSet {
     const int count = ::epoll_wait(epoll_.get(), ready, most, milliseconds);
     return count < 0 ? -errno : count;
   }
-  void handle(Entry* entry, std::uint32_t events) {
+  void handle(Entry* entry, std::uint32_t events) noexcept {
     handling_ = entry;
-    entry->handler(events);
+    run([entry, events] { entry->handler(events); });
     handling_ = nullptr;
     gone_.reset();
   }
@@ -278,7 +292,7 @@ void EventLoop::drainInbox() noexcept {
   hasOwnTasks_ = false;
   // What a task posts waits for the next wake-up, so that descriptors get their turn in between.
   for (auto& task : tasks) {
-    task();
+    run(task);
     task = nullptr;
   }
 }
@@ -293,7 +307,10 @@ std::unique_ptr<DescriptorSource> EventLoop::addDescriptor(int fd, std::uint32_t
 int EventLoop::onTime(sd_event_source* source, std::uint64_t, void* userdata) noexcept {
   auto* const raw = static_cast<Timer*>(userdata);
   const std::shared_ptr<Timer> timer = raw->loop->armed_.at(raw);  // outlives a handler that cancels itself
-  if (!timer->valid.load()) return 0;
+  if (!timer->valid.load()) {
+    timer->loop->disarm(*timer);
+    return 0;
+  }
   if (timer->interval > 0) {
     // Ticks that were missed are dropped; the rhythm stays.
     const std::uint64_t now = nowMicroseconds();
@@ -304,7 +321,7 @@ int EventLoop::onTime(sd_event_source* source, std::uint64_t, void* userdata) no
   } else {
     timer->loop->disarm(*timer);
   }
-  timer->handler();
+  run(timer->handler);
   return 0;
 }
 
@@ -317,8 +334,13 @@ bool EventLoop::arm(const std::shared_ptr<Timer>& timer) noexcept {
     return false;
   }
   timer->source.reset(source);
-  armed_.emplace(timer.get(), timer);
-  return true;
+  try {
+    armed_.emplace(timer.get(), timer);
+    return true;
+  } catch (const std::bad_alloc&) {
+    timer->source.reset();
+    return false;
+  }
 }
 
 void EventLoop::disarm(Timer& timer) noexcept {
@@ -339,6 +361,8 @@ std::unique_ptr<LoopSource> EventLoop::addTimer(std::chrono::nanoseconds first,
   timer->leeway = std::max<std::uint64_t>(toMicroseconds(leeway), 1);
   timer->handler = std::move(handler);
   timer->failed = std::move(failed);
+  // First: a timer that runs is one that somebody can end.
+  auto handle = std::make_unique<TimerHandle>(weak_from_this(), timer);
   if (onLoopThread()) {
     if (!arm(timer)) return nullptr;
   } else {
@@ -346,7 +370,7 @@ std::unique_ptr<LoopSource> EventLoop::addTimer(std::chrono::nanoseconds first,
       if (timer->valid.load() && !timer->loop->arm(timer) && timer->failed) timer->failed();
     });
   }
-  return std::make_unique<TimerHandle>(weak_from_this(), std::move(timer));
+  return handle;
 }
 
 void EventLoop::postAfter(std::chrono::nanoseconds delay, std::function<void()> task) {

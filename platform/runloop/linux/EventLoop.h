@@ -42,7 +42,7 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   // none.
   int runOnce(std::uint64_t timeOut) noexcept;
 
-  // Any thread.
+  // Any thread. May throw std::bad_alloc; a task that throws it is given up, with a line in the log.
   void post(std::function<void()> task);
   // Makes a waiting runOnce() return. Any thread, async-signal-safe.
   void wake() noexcept;

@@ -237,9 +237,14 @@ class PidfdExitSource final : public ProcessExitSource {
   };
   static void tell(const std::shared_ptr<State>& state) {
     state->told.store(true);
-    state->onGlobal([state] {
+    const auto exited = [state] {
       if (!state->cancelled.load()) state->onExit();
-    });
+    };
+    try {
+      state->onGlobal(exited);
+    } catch (const std::bad_alloc&) {
+      exited();  // the handlers are short, and nobody would tell once more
+    }
   }
   void onLoop(WorkQueue::Task task) {
     const auto loop = loop_.lock();
@@ -255,9 +260,18 @@ class PidfdExitSource final : public ProcessExitSource {
     // An exit that was told is watched no more: the loop need not wake up for it.
     if (!state_->told.load()) {
       if (loop_.expired()) state_->source.reset();  // its handler holds the state
-      onLoop([state = state_] { state->source.reset(); });
+      try {
+        onLoop([state = state_] { state->source.reset(); });
+      } catch (const std::bad_alloc&) {
+        // The exit lets go of it, untold.
+      }
     }
-    if (withHandler && state_->onCancel) state_->onGlobal([state = state_] { state->onCancel(); });
+    if (!withHandler || !state_->onCancel) return;
+    try {
+      state_->onGlobal([state = state_] { state->onCancel(); });
+    } catch (const std::bad_alloc&) {
+      state_->onCancel();
+    }
   }
   const std::weak_ptr<EventLoop> loop_;
   const std::shared_ptr<State> state_;

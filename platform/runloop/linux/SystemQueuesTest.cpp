@@ -19,9 +19,11 @@
 #include <filesystem>
 #include <future>
 #include <limits>
+#include <new>
 #include <vector>
 
 #include "platform/base/ProcessFacts.h"
+#include "platform/log/fakes/RecordingLog.h"
 
 namespace brenvik {
 namespace {
@@ -200,6 +202,25 @@ TEST_F(SystemQueuesTest, MainQueueRunsTasksInOrderOnTheLoop) {
   runUntil([&] { return order.size() == 3; });
   EXPECT_EQ(order, "abc");
   EXPECT_TRUE(queues.main().isCurrent());
+}
+
+TEST_F(SystemQueuesTest,
+       ATaskATimerAndADescriptorThatLackMemoryAreGivenUpWithALineAndTheOthersHaveTheirTurn) {
+  RecordingLog log;
+  SystemQueues queues(*loop);
+  const auto lackMemory = [] { throw std::bad_alloc(); };
+  const UniqueFd ready(::eventfd(1, EFD_CLOEXEC));
+  std::unique_ptr<DescriptorSource> source = loop->addDescriptor(ready.get(), EPOLLIN, [&](std::uint32_t) {
+    source.reset();
+    lackMemory();
+  });
+  bool isDone = false;
+  queues.main().post(lackMemory);
+  queues.main().postAfter(1ms, lackMemory);
+  queues.main().postAfter(2ms, [&] { isDone = true; });
+  runUntil([&] { return isDone; });
+  const auto line = RecordingLog::unifiedLine(LogLevel::error, "A task was given up: out of memory");
+  EXPECT_EQ(log.entries(), (std::vector{line, line, line}));
 }
 
 TEST_F(SystemQueuesTest, ASerialQueueIsNotItsMakersEvenBeforeItsThreadRuns) {

@@ -17,6 +17,7 @@
 
 #include "interface/TelephonyMessages.h"
 #include "platform/base/UniqueFd.h"
+#include "platform/base/Utf8.h"
 #include "platform/plist/PropertyList.h"
 #include "platform/plist/PropertyListCodec.h"
 
@@ -75,7 +76,11 @@ class ChannelConnection final : public TelephonyDaemonConnection {
   TelephonyResult push(std::int32_t id, std::span<const Value> values) noexcept try {
     std::vector<std::pair<std::string, PropertyList>> entries{{kClientKey, client_}};
     for (const Value& value : values) {
-      if (value.text) entries.emplace_back(value.key, PropertyList::string(*value.text));
+      if (!value.text) continue;
+      PropertyList text = PropertyList::string(*value.text);
+      // Without its text the push would say that nothing is known.
+      if (!text && isValidUtf8(*value.text)) return posixResult(ENOMEM);
+      entries.emplace_back(value.key, std::move(text));
     }
     const auto region =
         serializePropertyList(PropertyList::dictionary(std::move(entries)), PropertyListFormat::binary);
@@ -185,10 +190,15 @@ std::unique_ptr<TelephonyDaemonConnection> ChannelTelephonyDaemon::create(
   std::vector<PropertyList> identifiers;
   {
     const std::lock_guard lock(mutex_);
-    for (const auto& identifier : identifiers_) identifiers.push_back(PropertyList::string(identifier));
+    for (const auto& identifier : identifiers_) {
+      identifiers.push_back(PropertyList::string(identifier));
+      if (!identifiers.back()) return nullptr;
+    }
   }
-  return std::make_unique<ChannelConnection>(
-      std::move(channel), deadline, PropertyList::array(std::move(identifiers)), std::move(callback));
+  PropertyList client = PropertyList::array(identifiers);
+  if (!client) return nullptr;
+  return std::make_unique<ChannelConnection>(std::move(channel), deadline, std::move(client),
+                                             std::move(callback));
 } catch (const std::bad_alloc&) {
   return nullptr;
 }

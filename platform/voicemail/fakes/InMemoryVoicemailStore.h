@@ -16,26 +16,33 @@ class InMemoryVoicemailStore final : public VoicemailStore {
  public:
   std::vector<std::string> calls;  // names of the operations
 
-  void setToken(const std::string* token) noexcept override {
+  bool exhausted = false;  // there is no memory
+
+  bool setToken(const std::string* token) noexcept override {
     calls.push_back(token == nullptr ? "clearToken" : "setToken");
-    token_ = token == nullptr ? std::nullopt : std::optional(*token);
+    if (!exhausted) token_ = token == nullptr ? std::nullopt : std::optional(*token);
+    return !exhausted;
   }
-  void setTokenForKey(const std::string& key, const std::string& token) noexcept override {
+  bool setTokenForKey(const std::string& key, const std::string& token) noexcept override {
     calls.push_back("setTokenForKey");
-    tokens_[key] = token;
+    if (!exhausted) tokens_[key] = token;
+    return !exhausted;
   }
-  void removeAllRecords() noexcept override {
+  bool removeAllRecords() noexcept override {
     calls.push_back("removeAllRecords");
-    tokens_.clear();
+    if (!exhausted) tokens_.clear();
+    return !exhausted;
   }
-  std::optional<std::string> copyToken() noexcept override {
-    calls.push_back("copyToken");
-    return token_;
+  bool readToken(std::optional<std::string>* token) noexcept override {
+    calls.push_back("readToken");
+    *token = exhausted ? std::nullopt : token_;
+    return !exhausted;
   }
-  std::optional<std::string> copyTokenForKey(const std::string& key) noexcept override {
-    calls.push_back("copyTokenForKey");
+  bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept override {
+    calls.push_back("readTokenForKey");
     const auto found = tokens_.find(key);
-    return found == tokens_.end() ? std::nullopt : std::optional(found->second);
+    *token = exhausted || found == tokens_.end() ? std::nullopt : std::optional(found->second);
+    return !exhausted;
   }
 
  private:

@@ -58,7 +58,8 @@ class SqliteVoicemailStore::Database {
  public:
   // SQLITE_OK or SQLite's extended code.
   int open(const std::string& file) {
-    if (sqlite() == nullptr) return SQLITE_CANTOPEN;  // the library is not there
+    bool lackedMemory = false;
+    if (sqlite(&lackedMemory) == nullptr) return lackedMemory ? SQLITE_NOMEM : SQLITE_CANTOPEN;
     sqlite3* opened = nullptr;
     const int code = sqlite()->open_v2(file.c_str(), &opened,
                                        SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOFOLLOW | SQLITE_OPEN_EXRESCODE |
@@ -115,6 +116,7 @@ bool SqliteVoicemailStore::makePlace(std::string* file, IfMissing ifMissing) {
   if (account.home.empty()) return false;
   const std::unique_ptr<char, decltype(&std::free)> home(::realpath(account.home.c_str(), nullptr),
                                                          &std::free);
+  if (!home && errno == ENOMEM) throw std::bad_alloc();
   if (!home) return false;
   const bool create = ifMissing == IfMissing::create;
   const UniqueFd top(::open(home.get(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
@@ -138,11 +140,11 @@ bool SqliteVoicemailStore::makePlace(std::string* file, IfMissing ifMissing) {
   return true;
 }
 
-void SqliteVoicemailStore::write(const char* statement, const std::string* first,
+bool SqliteVoicemailStore::write(const char* statement, const std::string* first,
                                  const std::string* second) noexcept {
+  int code = SQLITE_CANTOPEN;
   try {
     std::string file;
-    int code = SQLITE_CANTOPEN;
     for (int attempt = 0; attempt < 2 && makePlace(&file, IfMissing::create); ++attempt) {
       Database database;
       code = database.open(file);
@@ -152,50 +154,50 @@ void SqliteVoicemailStore::write(const char* statement, const std::string* first
       logUnified(LogLevel::error, "The voicemail store is damaged; moved aside to voicemail.db.damaged");
       if (::rename(file.c_str(), (file + ".damaged").c_str()) != 0) break;
     }
-    if (code != SQLITE_OK) logUnified(LogLevel::error, "The voicemail store could not be written");
   } catch (const std::bad_alloc&) {
-    logUnified(LogLevel::error, "The voicemail store could not be written");
+    code = SQLITE_NOMEM;
   }
+  if (code != SQLITE_OK) logUnified(LogLevel::error, "The voicemail store could not be written");
+  return !isLackOfMemory(code);
 }
 
-std::optional<std::string> SqliteVoicemailStore::read(const char* statement,
-                                                      const std::string* key) noexcept {
+bool SqliteVoicemailStore::read(const char* statement, const std::string* key,
+                                std::optional<std::string>* token) noexcept {
+  token->reset();
   try {
     std::string file;
-    std::optional<std::string> token;
-    if (!makePlace(&file, IfMissing::fail)) return std::nullopt;
+    if (!makePlace(&file, IfMissing::fail)) return true;
     Database database;
-    if (database.open(file) != SQLITE_OK || database.run(statement, key, nullptr, &token) != SQLITE_OK) {
-      return std::nullopt;
-    }
-    return token;
+    int code = database.open(file);
+    if (code == SQLITE_OK) code = database.run(statement, key, nullptr, token);
+    return !isLackOfMemory(code);
   } catch (const std::bad_alloc&) {
-    return std::nullopt;
+    return false;
   }
 }
 
-void SqliteVoicemailStore::setToken(const std::string* token) noexcept {
-  if (token == nullptr) {
-    write("DELETE FROM general", nullptr, nullptr);
-  } else {
-    write("INSERT INTO general(id, token) VALUES(0, ?1) ON CONFLICT(id) DO UPDATE SET token = ?1", token,
-          nullptr);
-  }
+bool SqliteVoicemailStore::setToken(const std::string* token) noexcept {
+  if (token == nullptr) return write("DELETE FROM general", nullptr, nullptr);
+  return write("INSERT INTO general(id, token) VALUES(0, ?1) ON CONFLICT(id) DO UPDATE SET token = ?1", token,
+               nullptr);
 }
 
-void SqliteVoicemailStore::setTokenForKey(const std::string& key, const std::string& token) noexcept {
-  write("INSERT INTO tokens(key, token) VALUES(?1, ?2) ON CONFLICT(key) DO UPDATE SET token = ?2", &key,
-        &token);
+bool SqliteVoicemailStore::setTokenForKey(const std::string& key, const std::string& token) noexcept {
+  return write("INSERT INTO tokens(key, token) VALUES(?1, ?2) ON CONFLICT(key) DO UPDATE SET token = ?2",
+               &key, &token);
 }
 
-void SqliteVoicemailStore::removeAllRecords() noexcept { write("DELETE FROM tokens", nullptr, nullptr); }
-
-std::optional<std::string> SqliteVoicemailStore::copyToken() noexcept {
-  return read("SELECT token FROM general WHERE id = 0", nullptr);
+bool SqliteVoicemailStore::removeAllRecords() noexcept {
+  return write("DELETE FROM tokens", nullptr, nullptr);
 }
 
-std::optional<std::string> SqliteVoicemailStore::copyTokenForKey(const std::string& key) noexcept {
-  return read("SELECT token FROM tokens WHERE key = ?1", &key);
+bool SqliteVoicemailStore::readToken(std::optional<std::string>* token) noexcept {
+  return read("SELECT token FROM general WHERE id = 0", nullptr, token);
+}
+
+bool SqliteVoicemailStore::readTokenForKey(const std::string& key,
+                                           std::optional<std::string>* token) noexcept {
+  return read("SELECT token FROM tokens WHERE key = ?1", &key, token);
 }
 
 }  // namespace brenvik

@@ -29,19 +29,19 @@ class SqliteVoicemailStore final : public VoicemailStore {
   SqliteVoicemailStore(std::string home, uid_t uid, gid_t gid)
       : account_([account = Account{std::move(home), uid, gid}] { return account; }) {}
 
-  void setToken(const std::string* token) noexcept override;
-  void setTokenForKey(const std::string& key, const std::string& token) noexcept override;
-  void removeAllRecords() noexcept override;
-  std::optional<std::string> copyToken() noexcept override;
-  std::optional<std::string> copyTokenForKey(const std::string& key) noexcept override;
+  bool setToken(const std::string* token) noexcept override;
+  bool setTokenForKey(const std::string& key, const std::string& token) noexcept override;
+  bool removeAllRecords() noexcept override;
+  bool readToken(std::optional<std::string>* token) noexcept override;
+  bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept override;
 
  private:
   class Database;
   enum class IfMissing { fail, create };
 
   bool makePlace(std::string* file, IfMissing ifMissing);
-  void write(const char* statement, const std::string* first, const std::string* second) noexcept;
-  std::optional<std::string> read(const char* statement, const std::string* key) noexcept;
+  bool write(const char* statement, const std::string* first, const std::string* second) noexcept;
+  bool read(const char* statement, const std::string* key, std::optional<std::string>* token) noexcept;
 
   const std::function<Account()> account_;
 };

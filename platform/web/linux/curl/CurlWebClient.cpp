@@ -8,13 +8,14 @@
 #include <sys/socket.h>
 
 #include <algorithm>
-#include <future>
 #include <map>
 #include <mutex>
 #include <new>
 #include <optional>
+#include <semaphore>
 #include <span>
 #include <string_view>
+#include <thread>
 #include <utility>
 
 #include "platform/base/UniqueFd.h"
@@ -51,9 +52,13 @@ using Easy = std::unique_ptr<CURL, EasyCleanup>;
 using Multi = std::unique_ptr<CURLM, MultiCleanup>;
 using List = std::unique_ptr<curl_slist, ListCleanup>;
 
-// Once a process and never undone: other parts may use the library too.
+// Once a process and never undone: other parts may use the library too. A start that failed, for want of
+// memory say, is tried again.
 bool startLibrary() noexcept {
-  static const bool started = curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
+  static std::mutex mutex;
+  static bool started = false;
+  const std::lock_guard lock(mutex);
+  if (!started) started = curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
   return started;
 }
 
@@ -79,7 +84,7 @@ struct CurlWebClient::Transfer {
   HeaderMap headers;
   std::shared_ptr<Session> session;
   std::shared_ptr<WorkQueue> callbackQueue;
-  WebRequest::Completion completion;
+  std::shared_ptr<WebRequest::Completion> completion;  // shared beforehand: telling takes no memory
   milliseconds timeLimit{0};
   std::uint64_t largestBody = kLargestWebBody;
 
@@ -95,19 +100,24 @@ struct CurlWebClient::Transfer {
   bool wayWasCellular = false;
   std::optional<WebErrorKind> ownVerdict;  // why one of our callbacks stopped it
 
-  // Tells the outcome, the first time only.
-  void finish(WebErrorKind kind) {
+  // Tells the outcome, the first time only; somebody may be waiting for it without a limit.
+  void finish(WebErrorKind kind) noexcept {
     if (response == nullptr) return;
     response->errorKind = kind;
     response->headers = std::move(head.fields);
     if (kind != WebErrorKind::none) response->body = {};
-    if (callbackQueue == nullptr || !completion) return;
-    const auto done = std::make_shared<WebRequest::Completion>(std::move(completion));
+    const auto done = std::move(completion);
     const auto answer = std::move(response);
+    if (callbackQueue == nullptr || done == nullptr || *done == nullptr) return;
     try {
       callbackQueue->post([done, answer] { (*done)(answer); });
     } catch (...) {
-      (*done)(answer);  // its thread cannot be started; better told on the wrong queue than never
+      // Its thread cannot be started, or memory is short; better told on the wrong queue than never.
+      try {
+        (*done)(answer);
+      } catch (const std::bad_alloc&) {
+        // Whoever is told copes with that, or has a time-out.
+      }
     }
     callbackQueue.reset();
   }
@@ -218,12 +228,18 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
       abandonAll(WebErrorKind::cancelled);
       return;
     }
-    std::promise<void> abandoned;
-    queue->post([this, &abandoned] {
-      abandonAll(WebErrorKind::cancelled);
-      abandoned.set_value();
-    });
-    abandoned.get_future().wait();
+    // Whoever waits for a transfer waits until this is done, so it is, however long memory is short.
+    for (std::binary_semaphore abandoned(0);;) {
+      try {
+        queue->post([this, &abandoned] {
+          abandonAll(WebErrorKind::cancelled);
+          abandoned.release();
+        });
+        return abandoned.acquire();
+      } catch (const std::bad_alloc&) {
+        std::this_thread::sleep_for(milliseconds(10));
+      }
+    }
   }
 
  private:
@@ -231,12 +247,12 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
 
   void start(const std::shared_ptr<Transfer>& transfer) {
     try {
-      if (givingUp_) abandonAll(WebErrorKind::clientUnavailable);
       if (multi_ == nullptr && !makeMulti()) return transfer->finish(WebErrorKind::outOfMemory);
       attempt(transfer);
     } catch (...) {
       transfer->finish(WebErrorKind::outOfMemory);
     }
+    giveUpIfAsked();
   }
 
   bool makeMulti() {
@@ -392,29 +408,35 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
   }
 
   // The loop cannot watch a socket or time a wait, for want of descriptors or memory. libcurl does not end
-  // what it waits for in vain, so that is done here, once its callback has returned.
-  void giveUpSoon() noexcept {
-    if (std::exchange(givingUp_, true)) return;
-    loop_->post([weak = weak_from_this()] {
-      if (const auto self = weak.lock(); self != nullptr) self->abandonAll(WebErrorKind::clientUnavailable);
-    });
+  // what it waits for in vain, so that is done here, once it has returned: whoever calls it says so below.
+  void giveUpSoon() noexcept { givingUp_ = true; }
+  void giveUpIfAsked() noexcept {
+    if (givingUp_) abandonAll(WebErrorKind::clientUnavailable);
   }
 
   void timerFired() {
     const auto fired = std::move(timer_);
     if (!due_) return;
-    if (Clock::now() < *due_) return arm();
-    due_.reset();
-    act(CURL_SOCKET_TIMEOUT, 0);
-    // libcurl tells of a time-out only when it has changed; one it saw as not quite due has not.
-    long delay = -1;
-    if (!due_ && multi_ != nullptr && curl_multi_timeout(multi_.get(), &delay) == CURLM_OK) setTimer(delay);
+    if (Clock::now() < *due_) {
+      arm();
+    } else {
+      due_.reset();
+      act(CURL_SOCKET_TIMEOUT, 0);
+      // libcurl tells of a time-out only when it has changed; one it saw as not quite due has not.
+      long delay = -1;
+      if (!due_ && multi_ != nullptr && curl_multi_timeout(multi_.get(), &delay) == CURLM_OK) {
+        setTimer(delay);
+      }
+    }
+    giveUpIfAsked();
   }
 
   void act(curl_socket_t fd, int mask) {
-    if (givingUp_) return;  // libcurl 7.88 crashes when it is called after a callback of ours refused
     int running = 0;
-    (void)curl_multi_socket_action(multi_.get(), fd, mask, &running);  // what failed shows in the messages
+    // What failed of a transfer shows in the messages. Otherwise it lacked memory for its own books, and
+    // libcurl 7.88 crashes when it goes on with them, as it does after a callback of ours refused.
+    if (curl_multi_socket_action(multi_.get(), fd, mask, &running) != CURLM_OK) giveUpSoon();
+    if (givingUp_) return giveUpIfAsked();
     int left = 0;
     while (const CURLMsg* const message = curl_multi_info_read(multi_.get(), &left)) {
       if (message->msg != CURLMSG_DONE) continue;
@@ -434,6 +456,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
       due_.reset();
       timer_.reset();
     }
+    giveUpIfAsked();
   }
 
   void ended(const std::shared_ptr<Transfer>& transfer, CURLcode code) {
@@ -502,7 +525,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
     }
   }
 
-  void abandonAll(WebErrorKind kind) {
+  void abandonAll(WebErrorKind kind) noexcept {
     givingUp_ = true;  // what the loop still refuses below does not matter any more
     const auto abandoned = std::exchange(active_, {});
     for (const auto& [easy, transfer] : abandoned) {
@@ -542,7 +565,8 @@ class CurlWebClient::Request final : public WebRequest {
     if (transfer_ != nullptr) transfer_->callbackQueue = std::move(queue);
   }
   void setCompletion(Completion completion) override {
-    if (transfer_ != nullptr) transfer_->completion = std::move(completion);
+    if (transfer_ == nullptr) return;
+    transfer_->completion = std::make_shared<Completion>(std::move(completion));
   }
   void setTimeLimit(milliseconds limit) noexcept override {
     if (transfer_ != nullptr) transfer_->timeLimit = limit;
