@@ -8,11 +8,10 @@ import struct
 import subprocess
 import unittest
 
+import allocations
 import wire
-from harness import BUILD, Daemon, HelperTest, eventually, main
+from harness import Daemon, HelperTest, eventually, main
 
-COUNTER = BUILD / "libbrenvik-count-allocations.so"
-COUNT = pathlib.Path("/tmp/allocations")
 CALLS = 50
 
 # A request and the size of its reply. The routines themselves touch neither disk nor heap: a token that is no text,
@@ -25,7 +24,7 @@ IN_LINE = {
 }
 
 
-@unittest.skipUnless(COUNTER.exists(), "a sanitizer has costs of its own")
+@unittest.skipUnless(allocations.AVAILABLE, "a sanitizer has costs of its own")
 class Costs(HelperTest):
     def setUp(self):
         super().setUp()
@@ -76,23 +75,21 @@ class Costs(HelperTest):
 
     def test_an_in_line_request_takes_nothing_from_the_heap(self):
         self.daemon.stop()
-        COUNT.write_bytes(bytes(8))
-        self.daemon = Daemon(environment={"LD_PRELOAD": str(COUNTER), "BRENVIK_ALLOCATION_COUNT": str(COUNT)})
+        counter = allocations.Allocations()
+        self.addCleanup(counter.close)
+        self.daemon = Daemon(environment=counter.environment)
         self.caller = self.client()
-
-        def count():
-            return struct.unpack("<Q", COUNT.read_bytes())[0]
-        self.assertGreater(count(), 0, "the counter counts")
+        self.assertGreater(counter.made, 0, "the counter counts")
         for name, (message, size) in IN_LINE.items():
             with self.subTest(name):
                 self.call(message, size)
-                before = count()
+                before = counter.made
                 for _ in range(CALLS):
                     self.call(message, size)
-                self.assertEqual(count(), before)
-        before = count()
+                self.assertEqual(counter.made, before)
+        before = counter.made
         self.caller.copy_preference("com.example.costs", "key")
-        self.assertGreater(count(), before, "a routine that takes memory is noticed")
+        self.assertGreater(counter.made, before, "a routine that takes memory is noticed")
 
 
 if __name__ == "__main__":

@@ -61,6 +61,9 @@ class Brenvik:
             except OSError:
                 return
             data = connection.recv(wire.LARGEST)
+            if not data:  # the helper thought better of it
+                connection.close()
+                continue
             bits, size, reply_port, local, voucher, message_id, count = struct.unpack_from("<IIIIIiI", data)
             address, _, _, _, kind, length = struct.unpack_from("<QBBBBI", data, 28)
             assert (bits, size, local, voucher, count, address, kind) == (wire.COMPLEX | 18, 52, 0, 0, 1, 56, 1), data
