@@ -511,8 +511,8 @@ class Quiet:
 
     def __call__(self):
         made, since = None, time.monotonic()
-        while time.monotonic() - since < self.patience:
-            now = self.test.allocations.made, self.test.daemon.running() and self.sleeping()
+        while time.monotonic() - since < self.patience and self.test.daemon.running():
+            now = self.test.allocations.made, self.sleeping()
             if now != (made, True):
                 made, since = now[0], time.monotonic()
             time.sleep(0.002)
