@@ -58,12 +58,19 @@ void PathPolicy::buildTables() {
   if (hasHome_) homeBundlesDirectory_ = home + kHomeBundles;
 }
 
-bool PathPolicy::isListedCarrierPath(const char* path) noexcept {
+bool PathPolicy::hasTables() noexcept {
+  const std::lock_guard lock(mutex_);
   try {
-    std::call_once(built_, [this] { buildTables(); });
+    if (!built_) buildTables();
+    built_ = true;
   } catch (...) {
-    return false;
+    // Out of memory.
   }
+  return built_;
+}
+
+bool PathPolicy::isListedCarrierPath(const char* path) noexcept {
+  if (!hasTables()) return false;
   struct stat info {};
   // The bits of a symbolic link's type, tested and not compared: links, regular files, devices and sockets
   // share one with it and go on; directories and FIFOs share none and are refused.
@@ -77,11 +84,7 @@ bool PathPolicy::isListedCarrierPath(const char* path) noexcept {
 }
 
 bool PathPolicy::isAllowedCarrierPath(const char* path) noexcept {
-  try {
-    std::call_once(built_, [this] { buildTables(); });
-  } catch (...) {
-    return false;
-  }
+  if (!hasTables()) return false;
   const std::string_view compared = comparedPart(path);
   if (hasHome_ && compared.starts_with(homeBundlesDirectory_)) {
     logUnified(LogLevel::info, "Allowing path %s within %s", path, homeBundlesDirectory_.c_str());

@@ -30,10 +30,13 @@ class PathPolicy {
  private:
   static constexpr std::size_t kEntries = 32;
 
+  // Builds them when they are not there yet; false when there was no memory for it.
+  bool hasTables() noexcept;
   void buildTables();
 
   const MobileAccountSource account_;
-  std::once_flag built_;
+  std::mutex mutex_;
+  bool built_ = false;
   bool hasHome_ = false;
   std::string homeBundlesDirectory_;          // empty without a home
   std::array<std::string, kEntries> listed_;  // in the order of the search; empty: matches nothing

@@ -42,7 +42,9 @@ gid_t MobileUser::gid() {
 }
 
 void MobileUser::fillOnce() {
-  std::call_once(once_, [this] { fill(); });
+  const std::lock_guard lock(mutex_);
+  if (!filled_) fill();
+  filled_ = true;
 }
 
 void MobileUser::fill() {

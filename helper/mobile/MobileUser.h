@@ -40,7 +40,8 @@ class MobileUser {
 
   AccountDirectory& accounts_;
   CStringAllocator& allocator_;
-  std::once_flag once_;
+  std::mutex mutex_;
+  bool filled_ = false;
   char* homeDirectory_ = nullptr;
   uid_t uid_ = 0;
   gid_t gid_ = 0;
