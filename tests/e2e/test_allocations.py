@@ -595,7 +595,6 @@ class Location(AllocationsTest):
         self.sweep_pushes("RequestCountryCodeFromLocation", [struct.pack("<dd", 59.9133, 10.739)],
                           civic("NO", "Oslo", "Oslo"), civic("NO"))
 
-
     def test_wan_ip(self):
         hosts = pathlib.Path("/etc/hosts")
         hosts.write_text(hosts.read_text() + f"127.0.0.1 {STUN}\n")
