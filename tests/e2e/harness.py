@@ -5,6 +5,7 @@
 Every test runs as root in a machine of its own (see the sandbox script): it may write entitlements, become
 another account and stop the daemon it started.
 """
+import contextlib
 import os
 import pathlib
 import plistlib
@@ -190,8 +191,12 @@ class Daemon:
         return len(os.listdir(f"/proc/{self.pid}/fd"))
 
     def threads(self):
-        return sorted(pathlib.Path(f"/proc/{self.pid}/task/{task}/comm").read_text().strip()
-                      for task in os.listdir(f"/proc/{self.pid}/task"))
+        """Their names. One that ends while they are read, a resolver's for instance, is not among them."""
+        names = []
+        for task in os.listdir(f"/proc/{self.pid}/task"):
+            with contextlib.suppress(FileNotFoundError, ProcessLookupError):
+                names.append(pathlib.Path(f"/proc/{self.pid}/task/{task}/comm").read_text().strip())
+        return sorted(names)
 
     def resident_kib(self):
         return int(re.search(r"VmRSS:\s+(\d+)", pathlib.Path(f"/proc/{self.pid}/status").read_text())[1])

@@ -384,7 +384,7 @@ class Siege(HelperTest):
         """What the daemon has open. Files of preferences it may keep open, sixteen at most."""
         links = []
         for number in os.listdir(f"/proc/{self.daemon.pid}/fd"):
-            with contextlib.suppress(FileNotFoundError):
+            with contextlib.suppress(FileNotFoundError):  # closed since it was listed
                 links.append(re.sub(r":.*", "", os.readlink(f"/proc/{self.daemon.pid}/fd/{number}")))
         preferences = [link for link in links if "/Library/Preferences/" in link]
         self.assertLessEqual(len(preferences), 16)
