@@ -9,6 +9,7 @@ the pauses stay around the edge.
 import os
 import random
 import select
+import subprocess
 import threading
 import time
 import unittest
@@ -103,6 +104,24 @@ class IdleEdge(unittest.TestCase):
         finally:
             for daemon in daemons:
                 daemon.stop()
+
+
+class DemoShell(unittest.TestCase):
+    """What scripts/demo --shell has in place of a service manager."""
+
+    def test_a_daemon_that_left_for_being_idle_is_started_again_by_the_next_client(self):
+        entitle()
+        holder = subprocess.Popen(["./hold-socket", harness.BUILD / "BrenvikMobileHelper-hasty", SOCKET],
+                                  stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True)
+        self.addCleanup(holder.stdout.close)
+        self.addCleanup(holder.wait)
+        self.addCleanup(holder.kill)
+        says = iter(holder.stdout.readline, "")
+        self.assertEqual(next(says), "listening\n")
+        for _ in range(3):
+            with wire.Client() as client:
+                self.assertEqual(client.copy_preference("com.example.edge", "key"), b"")
+            self.assertEqual((next(says), next(says)), ("starting\n", "left with status 0\n"))
 
 
 if __name__ == "__main__":
