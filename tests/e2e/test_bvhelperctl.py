@@ -102,8 +102,11 @@ class Preferences(ToolTest):
                         "plist-file")
             self.assertEqual(self.json("prefs", "get", self.DOMAIN, "Large")["value"], value)
 
-    def test_a_text_that_is_not_utf8_is_refused_by_the_helper(self):
-        self.expect("bvhelperctl: the helper could not do it (code 5)\n", "prefs", "get", b"\xff", "k", status=1)
+    def test_a_domain_of_the_greatest_length_is_stored(self):
+        domain = "d" * 249
+        self.expect(f"set k of {domain}\n", "prefs", "set", domain, "k", "v")
+        self.assertTrue(pathlib.Path(f"/root/Library/Preferences/{domain}.plist").is_file())
+        self.expect("v\n", "prefs", "get", domain, "k")
 
 
 class Files(ToolTest):
@@ -139,6 +142,10 @@ class Labels(ToolTest):
         self.expect("I\nB\n", "labels", "badges", "--language", "en", "--text", "istanbul", "--label", "business")
         self.assertEqual(self.json("labels", "localized", "--label", "primary")["labels"], ["Primary"])
 
+    def test_labels_that_nobody_knows_have_no_badge(self):
+        self.expect("bvhelperctl: the helper knows none of these labels (code 5)\n", "labels", "badges", "--label",
+                    "USER_LABEL_own", status=1)
+
 
 class Contacts(ToolTest):
     def test_without_a_contacts_store_the_remap_counts_as_done(self):
@@ -166,6 +173,9 @@ class Carrier(ToolTest):
         self.assertFalse(other.is_symlink())
         self.expect(f"{other} -> t\n", "carrier", "create-link", "t", str(other))
         self.assertEqual(other.readlink(), pathlib.Path("t"))
+        nowhere = self.folder / "none" / "link"
+        self.expect(f"bvhelperctl: {nowhere} cannot be made: its folder is missing, or may not be written by the helper "
+                    "(code 5)\n", "carrier", "create-link", "t", str(nowhere), status=1)
         self.expect(f"bvhelperctl: refused: {other} is no carrier file: not listed, not in the carrier bundles, no "
                     "package in /tmp\n", "carrier", "remove", str(other), status=1)
 

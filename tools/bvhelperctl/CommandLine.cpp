@@ -3,6 +3,7 @@
 #include "tools/bvhelperctl/CommandLine.h"
 
 #include <pwd.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <CLI/CLI.hpp>
@@ -14,6 +15,7 @@
 #include <cstring>
 #include <deque>
 #include <memory>
+#include <optional>
 #include <string>
 
 #include "tools/bvhelperctl/CommandTable.h"
@@ -30,7 +32,7 @@ enum ExitStatus { kDone = 0, kRefused = 1, kUnusable = 2 };
 struct Settings {
   bool asJson = false;
   double timeout = BVMH_DEFAULT_TIMEOUT_MS / 1000.0;  // seconds
-  std::string socket;                                 // empty: the place compiled in
+  std::optional<std::string> socket;                  // none: the place compiled in
 };
 
 struct FreeClient {
@@ -48,6 +50,7 @@ int fail(const Settings& settings, ExitStatus status, const std::string& message
     nlohmann::ordered_json line{{"ok", false}};
     line.update(fields);
     line["error"] = message;
+    if (!advice.empty()) line["advice"] = advice;
     printJson(line);
   } else {
     std::fprintf(stderr, "%s: %s\n", kProgram, message.c_str());
@@ -67,9 +70,19 @@ std::string accountOfThisProcess() {
   return account == nullptr ? "user " + std::to_string(::geteuid()) : printable(account->pw_name);
 }
 
+// Whether others than root could change this program: it gets no entitlement then.
+bool isChangeableByOthers() {
+  struct stat facts {};
+  return ::stat("/proc/self/exe", &facts) == 0 && (facts.st_uid != 0 || (facts.st_mode & 022) != 0);
+}
+
 // What to do about a refused check-in, ready to be copied.
 std::string entitlementAdvice() {
-  return "Give it one: put the following into a file " BRENVIK_ENTITLEMENT_DIRECTORY
+  const std::string owner = isChangeableByOthers()
+                                ? "This program must belong to root first, and be writable by nobody else.\n"
+                                : "";
+  return owner +
+         "Give it one: put the following into a file " BRENVIK_ENTITLEMENT_DIRECTORY
          "/bvhelperctl.plist, owned by root and writable by nobody else:\n"
          "  <?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
          "  <plist version=\"1.0\"><dict>\n"
@@ -86,9 +99,7 @@ std::string entitlementAdvice() {
 
 bool isTransportFailure(std::int32_t code) { return code >= BVMH_ERROR_FIRST && code <= BVMH_ERROR_LAST; }
 
-std::string socketOf(const Settings& settings) {
-  return settings.socket.empty() ? bvmh_service_socket() : settings.socket;
-}
+std::string socketOf(const Settings& settings) { return settings.socket.value_or(bvmh_service_socket()); }
 
 int reportCode(const Settings& settings, bvmh_client* client, const char* routine, std::int32_t code,
                const std::string& failure) {
@@ -143,7 +154,7 @@ int watch(const Settings& settings, const Values& values) {
   options.directory = values.get("--directory", "");
   if (values.has("--count")) options.most = std::stoull(values["--count"]);
   if (values.has("--helper-uid"))
-    options.helperUid = static_cast<std::uint32_t>(std::stol(values["--helper-uid"]));
+    options.helperUid = static_cast<std::uint32_t>(std::stoul(values["--helper-uid"]));
   return printEvents(options);
 }
 
@@ -152,7 +163,7 @@ int run(const Settings& settings, const Command& command, const Values& values) 
   const ClientPointer client(bvmh_client_create());
   if (client == nullptr) return fail(settings, kUnusable, "out of memory");
   bvmh_client_set_timeout(client.get(), static_cast<std::uint32_t>(std::ceil(settings.timeout * 1000)));
-  if (!settings.socket.empty() && bvmh_client_set_socket(client.get(), settings.socket.c_str()) != BVMH_OK) {
+  if (settings.socket && bvmh_client_set_socket(client.get(), settings.socket->c_str()) != BVMH_OK) {
     return fail(settings, kUnusable, "--socket: the path is empty or too long for a socket");
   }
   return report(settings, client.get(), command.run(client.get(), values));
@@ -205,10 +216,13 @@ Values collect(Parsed& parsed) {
   return values;
 }
 
-const char* globalHelp(std::string_view name) {
+const Parameter& globalOption(std::string_view name) {
   const auto& all = globalOptions();
-  return std::find_if(all.begin(), all.end(), [&](const Parameter& each) { return name == each.name; })->help;
+  return *std::find_if(all.begin(), all.end(), [&](const Parameter& each) { return name == each.name; });
 }
+
+constexpr const char* kStatuses =
+    "Exit status: 0 done; 1 the helper refused or could not do it; 2 wrong usage, or no helper.";
 
 }  // namespace
 
@@ -225,12 +239,13 @@ int runCommandLine(int argc, const char* const* argv) {
     CLI::App app("Asks BrenvikMobileHelper for what it does for the telephony daemon.", kProgram);
     app.require_subcommand(1);
     app.set_version_flag("--version", std::string(kProgram) + " " BRENVIK_VERSION);
-    app.add_flag("--json", settings.asJson, globalHelp("--json"));
-    app.add_option("--timeout", settings.timeout, globalHelp("--timeout"))
-        ->option_text("SECONDS")
-        ->check(CLI::Range(0.001, 4'000'000.0));
-    app.add_option("--socket", settings.socket, globalHelp("--socket"))->option_text("PATH");
-    app.footer("Exit status: 0 done; 1 the helper refused or could not do it; 2 wrong usage, or no helper.");
+    std::string timeout;
+    app.add_flag("--json", settings.asJson, globalOption("--json").help);
+    app.add_option("--timeout", timeout, globalOption("--timeout").help)->option_text("SECONDS");
+    app.add_option("--socket", settings.socket, globalOption("--socket").help)->option_text("PATH");
+    // Of the groups and commands, which are added below.
+    app.footer(std::string("--json, --timeout and --socket may stand here, too: see ") + kProgram +
+               " --help.\n" + kStatuses);
 
     std::map<std::string, CLI::App*> groups;
     for (const Group& each : commandGroups()) {
@@ -244,6 +259,7 @@ int runCommandLine(int argc, const char* const* argv) {
       parsed.command = &each;
       addCommand(*each.group == '\0' ? app : *groups.at(each.group), parsed);
     }
+    app.footer(kStatuses);
     try {
       app.parse(argc, argv);
     } catch (const CLI::ParseError& error) {
@@ -254,6 +270,9 @@ int runCommandLine(int argc, const char* const* argv) {
       const std::string message =
           unknown.empty() ? error.what() : "not expected: " + printable(unknown.front());
       return fail(settings, kUnusable, message, "Run with --help for more.");
+    }
+    if (app.count("--timeout") != 0) {
+      settings.timeout = secondsIn(checkedValue(globalOption("--timeout"), timeout));
     }
     for (Parsed& each : commands) {
       if (each.app->parsed()) return run(settings, *each.command, collect(each));

@@ -3,13 +3,17 @@
 #include "tools/bvhelperctl/CommandTable.h"
 
 #include <algorithm>
+#include <array>
+#include <cerrno>
 #include <charconv>
 #include <cmath>
+#include <cstdio>
+#include <cstring>
 #include <filesystem>
-#include <fstream>
-#include <iterator>
+#include <memory>
 #include <system_error>
 
+#include "platform/base/Utf8.h"
 #include "platform/plist/PropertyListCodec.h"
 #include "tools/support/Base64.h"
 #include "tools/support/PropertyListText.h"
@@ -58,13 +62,32 @@ PropertyList valueOfType(const std::string& type, const std::string& text) {
 }
 
 std::string propertyListFile(const std::string& path) {
-  std::ifstream file(path, std::ios::binary);
-  std::string content{std::istreambuf_iterator<char>(file), {}};
-  if (!file.is_open() || file.bad()) throw UsageError{"cannot read " + printable(path)};
+  const auto unreadable = [&] {
+    return UsageError{"cannot read " + printable(path) + ": " + std::strerror(errno)};
+  };
+  struct Close {
+    void operator()(std::FILE* file) const { (void)std::fclose(file); }  // only read from
+  };
+  const std::unique_ptr<std::FILE, Close> file(std::fopen(path.c_str(), "rbe"));
+  if (file == nullptr) throw unreadable();
+  std::string content;
+  std::array<char, 65536> part;
+  while (const std::size_t count = std::fread(part.data(), 1, part.size(), file.get()))
+    content.append(part.data(), count);
+  if (std::ferror(file.get()) != 0) throw unreadable();
   if (!parsePropertyList(std::as_bytes(std::span(content)))) {
     throw UsageError{printable(path) + " is not a property list"};
   }
   return content;
+}
+
+// The helper stores nothing under such a name, and its answer does not say so.
+const std::string& domainOfAFile(const std::string& domain) {
+  if (domain.empty() || domain == "." || domain == ".." || domain.find('/') != std::string::npos) {
+    throw UsageError{"DOMAIN: \"" + printable(domain) +
+                     "\" names no file: it is empty, \".\" or \"..\", or holds a slash"};
+  }
+  return domain;
 }
 
 std::string serialized(const PropertyList& value) {
@@ -131,19 +154,20 @@ Outcome ping(bvmh_client* client, const Values&) {
 }
 
 Outcome setPreference(bvmh_client* client, const Values& values) {
+  const std::string& domain = domainOfAFile(values["DOMAIN"]);
   const std::string type = values.get("--type", "string");
   const std::string value = type == "plist-file" ? propertyListFile(values["VALUE"])
                                                  : serialized(valueOfType(type, values["VALUE"]));
-  BVHELPERCTL_CALL(BVMobileHelperSetPreferenceValue, client, values["DOMAIN"].c_str(), values["KEY"].c_str(),
+  BVHELPERCTL_CALL(BVMobileHelperSetPreferenceValue, client, domain.c_str(), values["KEY"].c_str(),
                    value.data(), value.size());
-  return did(name, code, "set " + printable(values["KEY"]) + " of " + printable(values["DOMAIN"]));
+  return did(name, code, "set " + printable(values["KEY"]) + " of " + printable(domain));
 }
 
 Outcome deletePreference(bvmh_client* client, const Values& values) {
+  const std::string& domain = domainOfAFile(values["DOMAIN"]);
   // One byte, whatever it is, stands for "no value".
-  BVHELPERCTL_CALL(BVMobileHelperSetPreferenceValue, client, values["DOMAIN"].c_str(), values["KEY"].c_str(),
-                   "", 1);
-  return did(name, code, "removed " + printable(values["KEY"]) + " of " + printable(values["DOMAIN"]));
+  BVHELPERCTL_CALL(BVMobileHelperSetPreferenceValue, client, domain.c_str(), values["KEY"].c_str(), "", 1);
+  return did(name, code, "removed " + printable(values["KEY"]) + " of " + printable(domain));
 }
 
 Outcome getPreference(bvmh_client* client, const Values& values) {
@@ -211,6 +235,11 @@ Outcome showVoicemailSubscription(bvmh_client* client, const Values&) {
   return outcome;
 }
 
+// Of a routine that answers "failed" when symlink(2) does.
+std::string linkFailure(const std::string& link) {
+  return printable(link) + " cannot be made: its folder is missing, or may not be written by the helper";
+}
+
 Outcome replaceCarrierLink(bvmh_client* client, const Values& values) {
   const std::string& link = values["LINK"];
   BVHELPERCTL_CALL(BVMobileHelperReplaceCarrierSymlink, client, values["TARGET"].c_str(), link.c_str(),
@@ -220,12 +249,16 @@ Outcome replaceCarrierLink(bvmh_client* client, const Values& values) {
     outcome.failure =
         printable(link) + " is not one of the carrier links and files that may be replaced, or is a folder";
   }
+  if (code == BVMH_FAILURE) outcome.failure = linkFailure(link);
   return outcome;
 }
 
 Outcome createLink(bvmh_client* client, const Values& values) {
-  BVHELPERCTL_CALL(BVMobileHelperCreateSymlink, client, values["TARGET"].c_str(), values["LINK"].c_str());
-  return did(name, code, printable(values["LINK"]) + " -> " + printable(values["TARGET"]));
+  const std::string& link = values["LINK"];
+  BVHELPERCTL_CALL(BVMobileHelperCreateSymlink, client, values["TARGET"].c_str(), link.c_str());
+  Outcome outcome = did(name, code, printable(link) + " -> " + printable(values["TARGET"]));
+  if (code == BVMH_FAILURE) outcome.failure = linkFailure(link);
+  return outcome;
 }
 
 Outcome removeCarrierFile(bvmh_client* client, const Values& values) {
@@ -235,6 +268,10 @@ Outcome removeCarrierFile(bvmh_client* client, const Values& values) {
   if (code == BVMH_NO_ACCESS) {
     outcome.failure =
         printable(path) + " is no carrier file: not listed, not in the carrier bundles, no package in /tmp";
+  }
+  if (code == BVMH_FAILURE) {
+    outcome.failure =
+        printable(path) + " cannot be removed: it is missing, a folder with something in it, or read-only";
   }
   return outcome;
 }
@@ -332,8 +369,17 @@ Outcome showCountry(bvmh_client* client, const Values&) {
   return returnedText(name, code, "country", country, "(not known)");
 }
 
+// The six that the helper knows; it leaves out any other without a word.
+constexpr const char* kLabels[] = {"primary", "secondary", "personal", "business", "travel", "cell-data"};
+
 std::string labelKey(const std::string& label) {
   if (label.starts_with("USER_LABEL_")) return label;
+  if (std::none_of(std::begin(kLabels), std::end(kLabels), [&](const char* each) { return label == each; })) {
+    std::string all;
+    for (const char* each : kLabels) all += std::string(each) + ", ";
+    throw UsageError{"--label: \"" + printable(label) + "\" is not one of: " + all +
+                     "or a key that begins with USER_LABEL_"};
+  }
   std::string key = "USER_LABEL_";
   for (const char each : label)
     key += each == '-' ? '_' : static_cast<char>(each >= 'a' && each <= 'z' ? each - 32 : each);
@@ -358,6 +404,7 @@ Outcome askForLabels(const char* name, LabelsRoutine routine, bvmh_client* clien
                                 : routine(client, labelBytes.data(), labelBytes.size(), languageBytes.data(),
                                           languageBytes.size(), &region);
   Outcome outcome = did(name, code, "");
+  if (code == BVMH_FAILURE) outcome.failure = "the helper knows none of these labels";
   if (code != BVMH_OK) return outcome;
   const PropertyList result = parsePropertyList({static_cast<const std::byte*>(region.bytes), region.size});
   bvmh_region_free(&region);
@@ -409,8 +456,11 @@ Outcome remapChannel(bvmh_client* client, const Values& values) {
 constexpr std::size_t kShort = 63;
 constexpr std::size_t kText = 255;
 constexpr std::size_t kLong = 1023;
+// The domain's file is named DOMAIN.plist, and a file name has at most 255 bytes.
+constexpr std::size_t kDomainName = 249;
 
-const Parameter kDomain{"DOMAIN", "preference domain, such as com.norvale.carrier", ValueKind::text, kText};
+const Parameter kDomain{"DOMAIN", "preference domain, such as com.norvale.carrier", ValueKind::text,
+                        kDomainName};
 const Parameter kKey{"KEY", "name of the value", ValueKind::text, kText};
 const Parameter kState{"STATE", "on or off", ValueKind::choice, 0, {"on", "off"}};
 const Parameter kTokenKey{
@@ -441,6 +491,9 @@ Parameter file(const char* name, const char* help, std::size_t limit) {
 Parameter words(const char* name, const char* help, std::size_t limit) {
   return {name, help, ValueKind::text, limit};
 }
+Parameter bytes(const char* name, const char* help, std::size_t limit) {
+  return {name, help, ValueKind::bytes, limit};
+}
 
 std::vector<Command> makeTable() {
   return {
@@ -450,7 +503,7 @@ std::vector<Command> makeTable() {
        "set",
        "store a preference value",
        {"BVMobileHelperSetPreferenceValue"},
-       {kDomain, kKey, words("VALUE", "the value; with --type plist-file, a file", 0)},
+       {kDomain, kKey, bytes("VALUE", "the value; with --type plist-file, a file", 0)},
        {{"--type",
          "string (default), integer, real, bool, data (base64) or plist-file",
          ValueKind::choice,
@@ -529,7 +582,7 @@ std::vector<Command> makeTable() {
        "replace-link",
        "replace one of the carrier links",
        {"BVMobileHelperReplaceCarrierSymlink"},
-       {words("TARGET", "what the link says, as it stands", kLong),
+       {bytes("TARGET", "what the link says, as it stands", kLong),
         file("LINK", "one of the known carrier files", kLong)},
        {kFlushedDomain},
        replaceCarrierLink},
@@ -537,7 +590,7 @@ std::vector<Command> makeTable() {
        "create-link",
        "replace any file by a link",
        {"BVMobileHelperCreateSymlink"},
-       {words("TARGET", "what the link says, as it stands", kLong), file("LINK", "the link", kLong)},
+       {bytes("TARGET", "what the link says, as it stands", kLong), file("LINK", "the link", kLong)},
        {},
        createLink},
       {"carrier",
@@ -553,7 +606,7 @@ std::vector<Command> makeTable() {
        {"BVMobileHelperCopyCarrierFile"},
        {file("SOURCE-DIR", "folder to copy from", kText),
         file("DESTINATION-DIR", "carrier folder to copy into", kText),
-        words("NAME", "the file's name in both", kText)},
+        bytes("NAME", "the file's name in both", kText)},
        {},
        copyCarrierFile},
       {"carrier",
@@ -568,7 +621,7 @@ std::vector<Command> makeTable() {
        "move a folder into the carrier bundles",
        {"BVMobileHelperMoveIntoCarrierBundles"},
        {file("SOURCE", "the folder", kText), file("DESTINATION-DIR", "carrier bundles folder", kText),
-        words("NAME", "its name there", kText)},
+        bytes("NAME", "its name there", kText)},
        {},
        moveBundle},
       {"carrier",
@@ -669,7 +722,7 @@ std::vector<Command> makeTable() {
        {},
        {{"--count", "leave after so many", ValueKind::count, 0, {}, false, "N"},
         {"--directory", "folder of named services", ValueKind::path, 0, {}, false, "DIR"},
-        {"--helper-uid", "take messages from this user too", ValueKind::integer, 0, {}, false, "UID"}},
+        {"--helper-uid", "take messages from this user too", ValueKind::user, 0, {}, false, "UID"}},
        nullptr,
        true},
   };
@@ -686,7 +739,13 @@ const std::string* Values::find(std::string_view name) const {
 const std::vector<Parameter>& globalOptions() {
   static const std::vector<Parameter> options{
       {"--json", "print one JSON object a line", ValueKind::text, 0, {}, false, nullptr},
-      {"--timeout", "seconds to wait for each answer, default 30", ValueKind::text, 0, {}, false, "SECONDS"},
+      {"--timeout",
+       "seconds to wait for each answer, default 30",
+       ValueKind::seconds,
+       0,
+       {},
+       false,
+       "SECONDS"},
       {"--socket", "the helper's service socket", ValueKind::path, 0, {}, false, "PATH"},
       {"--version", "show the version", ValueKind::text, 0, {}, false, nullptr},
       {"--help", "show what there is", ValueKind::text, 0, {}, false, nullptr},
@@ -728,6 +787,9 @@ std::string checkedValue(const Parameter& parameter, const std::string& given) {
   std::string value = given;
   switch (parameter.kind) {
     case ValueKind::text:
+      if (!isValidUtf8(given)) throw wrong("UTF-8");
+      break;
+    case ValueKind::bytes:
       break;
     case ValueKind::path: {
       std::error_code error;
@@ -748,6 +810,13 @@ std::string checkedValue(const Parameter& parameter, const std::string& given) {
     case ValueKind::count:
       if (numberIn<std::int32_t>(given).value_or(0) < 1) throw wrong("a number from 1 on");
       break;
+    case ValueKind::user:
+      if (!numberIn<std::uint32_t>(given)) throw wrong("a user's number");
+      break;
+    case ValueKind::seconds:
+      // As milliseconds they must fit 32 bits.
+      if (!isBetween(0.001, 4'000'000)) throw wrong("a number of seconds, 0.001 to 4000000");
+      break;
     case ValueKind::choice:
       if (std::none_of(parameter.choices.begin(), parameter.choices.end(),
                        [&](const char* each) { return given == each; })) {
@@ -762,5 +831,7 @@ std::string checkedValue(const Parameter& parameter, const std::string& given) {
   }
   return value;
 }
+
+double secondsIn(const std::string& value) { return numberIn<double>(value).value_or(0); }
 
 }  // namespace brenvik::tools

@@ -20,12 +20,15 @@ namespace brenvik::tools {
 
 // What a word on the command line may be; checked before anything is sent.
 enum class ValueKind : std::uint8_t {
-  text,
+  text,       // UTF-8
+  bytes,      // goes to the helper as it stands, or is checked by the command itself
   path,       // of a file that the helper opens: made absolute, since it works in another folder
   latitude,   // degrees
   longitude,  // degrees
   integer,    // 32 bits, signed
   count,      // from 1
+  user,       // a user's number
+  seconds,    // from a millisecond on
   choice,     // one of Parameter::choices
 };
 
@@ -99,5 +102,8 @@ std::string wordsOf(const Command& command);
 
 // The value of a parameter made ready for the helper; throws UsageError when it does not fit.
 std::string checkedValue(const Parameter& parameter, const std::string& given);
+
+// The number in a value that checkedValue has let through.
+double secondsIn(const std::string& value);
 
 }  // namespace brenvik::tools

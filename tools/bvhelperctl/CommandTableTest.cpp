@@ -60,6 +60,17 @@ TEST(CommandTableTest, ValuesAreCheckedBeforeTheyAreSent) {
   const Parameter text{"KEY", "", ValueKind::text, 255};
   EXPECT_EQ(checkedValue(text, std::string(255, 'x')), std::string(255, 'x'));
   expectRefused(text, std::string(256, 'x'), "KEY: at most 255 bytes");
+  expectRefused(text, "\xff", "KEY: \"\\xff\" is not UTF-8");
+  EXPECT_EQ(checkedValue({"TARGET", "", ValueKind::bytes}, "\xff"), "\xff");
+  const Parameter user{"--helper-uid", "", ValueKind::user};
+  EXPECT_EQ(checkedValue(user, "4294967294"), "4294967294");
+  expectRefused(user, "-1", "--helper-uid: \"-1\" is not a user's number");
+  const Parameter timeout{"--timeout", "", ValueKind::seconds};
+  EXPECT_EQ(secondsIn(checkedValue(timeout, "0.25")), 0.25);
+  for (const char* wrong : {"nan", "inf", "-1", "0", "4000001", "1s", ""}) {
+    expectRefused(timeout, wrong,
+                  "--timeout: \"" + std::string(wrong) + "\" is not a number of seconds, 0.001 to 4000000");
+  }
 }
 
 TEST(CommandTableTest, PathsAreMadeAbsolute) {

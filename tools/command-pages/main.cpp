@@ -296,8 +296,10 @@ void manualCommand(const Command& command) {
   summary.front() = static_cast<char>(std::toupper(static_cast<unsigned char>(summary.front())));
   print("\n\t" + scd(summary) + ".");
   if (!command.routines.empty()) {
-    std::vector<std::string> routines(command.routines.begin(), command.routines.end());
-    print(" Calls " + scd(joined(routines)) + ".");
+    std::string routines;
+    for (const char* each : command.routines)
+      routines += (routines.empty() ? "" : " or ") + std::string(each);
+    print(" Calls " + scd(routines) + ".");
   }
   print("\n\n");
   for (const Parameter& each : command.positionals) {

@@ -10,6 +10,7 @@ import json
 import os
 import pathlib
 import plistlib
+import shutil
 import signal
 import socket
 import struct
@@ -233,16 +234,30 @@ class Refusals(ToolTest):
         out, err = self.run_tool("ping", status=1)
         self.assertEqual(out, "")
         lines = err.splitlines()
-        self.assertEqual(lines[0], f"bvhelperctl: refused: the caller lacks the entitlement {ALLOW}")
-        self.assertIn("/etc/brenvik/entitlements.d/bvhelperctl.plist", lines[1])
+        self.assertEqual(lines.pop(0), f"bvhelperctl: refused: the caller lacks the entitlement {ALLOW}")
+        program = (BUILD / "bvhelperctl").stat()
+        if program.st_uid != 0 or program.st_mode & 0o022:
+            self.assertEqual(lines.pop(0), "This program must belong to root first, and be writable by nobody else.")
+        self.assertIn("/etc/brenvik/entitlements.d/bvhelperctl.plist", lines[0])
         # What it says is a good entitlement file for this very program.
-        advice = plistlib.loads("\n".join(line.strip() for line in lines[2:]).encode())
+        advice = plistlib.loads("\n".join(line.strip() for line in lines[1:]).encode())
         self.assertEqual(advice["Executable"], str((BUILD / "bvhelperctl").resolve()))
         self.assertEqual(advice["Entitlements"], {ALLOW: True})
         self.assertIn("User", advice)
         answer = self.json("heartbeat", "on", status=1)
         self.assertEqual(answer, {"ok": False, "routine": "BVMobileHelperCellularHeartbeat", "code": 35,
-                                  "error": f"refused: the caller lacks the entitlement {ALLOW}"})
+                                  "error": f"refused: the caller lacks the entitlement {ALLOW}",
+                                  "advice": "\n".join(err.splitlines()[1:])})
+
+    def test_a_program_that_others_may_change_is_told_to_mend_that_first(self):
+        self.helper(refusal=35)
+        copy = self.folder / "bvhelperctl"
+        shutil.copy(BUILD / "bvhelperctl", copy)
+        copy.chmod(0o775)
+        done = subprocess.run([copy, "--socket", self.socket, "ping"], capture_output=True, text=True, timeout=60)
+        self.assertEqual(done.returncode, 1)
+        self.assertEqual(done.stderr.splitlines()[1],
+                         "This program must belong to root first, and be writable by nobody else.")
 
     def test_codes_are_explained(self):
         for arguments, code, message in [
@@ -253,7 +268,13 @@ class Refusals(ToolTest):
              "refused: /l is not one of the carrier links and files that may be replaced, or is a folder"),
             (["carrier", "remove", "/f"], 8, "refused: /f is no carrier file: not listed, not in the carrier bundles, "
                                              "no package in /tmp"),
-            (["carrier", "create-link", "t", "/l"], 5, "the helper could not do it (code 5)"),
+            (["carrier", "create-link", "t", "/l"], 5,
+             "/l cannot be made: its folder is missing, or may not be written by the helper (code 5)"),
+            (["carrier", "replace-link", "t", "/l"], 5,
+             "/l cannot be made: its folder is missing, or may not be written by the helper (code 5)"),
+            (["carrier", "remove", "/f"], 5,
+             "/f cannot be removed: it is missing, a folder with something in it, or read-only (code 5)"),
+            (["labels", "badges", "--label", "USER_LABEL_own"], 5, "the helper knows none of these labels (code 5)"),
             (["radio-logs", "on"], 46, "not supported by this build of the helper (code 46)"),
             (["heartbeat", "on"], -304, "the helper found the request malformed (code -304)"),
             (["location", "country"], 4711, "the helper answered with a code of its system (code 4711)"),
@@ -333,10 +354,17 @@ class Unusable(ToolTest):
             (["prefs", "set", "d", "k", "v", "--type", "date"],
              '--type: "date" is not one of: string, integer, real, bool, data, plist-file'),
             (["prefs", "set", "d", "k", "--type", "plist-file", f"{self.folder}/none"],
-             f"cannot read {self.folder}/none"),
+             f"cannot read {self.folder}/none: No such file or directory"),
+            (["prefs", "set", "d", "k", "--type", "plist-file", f"{self.folder}"],
+             f"cannot read {self.folder}: Is a directory"),
             (["prefs", "set", "d", "k", "--type", "plist-file", f"{self.folder}/no.plist"],
              f"{self.folder}/no.plist is not a property list"),
             (["prefs", "get", "d", "k" * 256], "KEY: at most 255 bytes"),
+            (["prefs", "set", "d" * 250, "k", "v"], "DOMAIN: at most 249 bytes"),
+            (["prefs", "set", "../evil", "k", "v"],
+             'DOMAIN: "../evil" names no file: it is empty, "." or "..", or holds a slash'),
+            (["prefs", "delete", "", "k"], 'DOMAIN: "" names no file: it is empty, "." or "..", or holds a slash'),
+            (["prefs", "get", b"\xff", "k"], 'DOMAIN: "\\xff" is not UTF-8'),
             (["contacts", "remap", "f" * 64, "t"], "FROM: at most 63 bytes"),
             (["heartbeat", "maybe"], 'STATE: "maybe" is not one of: on, off'),
             (["lasd", "check", "--type", "5g"], '--type: "5g" is not one of: gsm, umts, cdma, lte, scdma'),
@@ -345,12 +373,20 @@ class Unusable(ToolTest):
              "--mask and --type say the same: give one of them"),
             (["location", "civic", "91", "0"], 'LATITUDE: "91" is not a latitude, -90 to 90'),
             (["labels", "badges"], "no label given"),
+            (["labels", "localized", "--label", "work"], '--label: "work" is not one of: primary, secondary, personal, '
+             "business, travel, cell-data, or a key that begins with USER_LABEL_"),
             (["watch", "--count", "0"], '--count: "0" is not a number from 1 on'),
+            (["watch", "--helper-uid", "-1"], '--helper-uid: "-1" is not a user\'s number'),
+            (["--timeout", "nan", "ping"], '--timeout: "nan" is not a number of seconds, 0.001 to 4000000'),
+            (["--timeout", "soon", "ping"], '--timeout: "soon" is not a number of seconds, 0.001 to 4000000'),
+            (["ping", "--timeout", "0"], '--timeout: "0" is not a number of seconds, 0.001 to 4000000'),
         ]:
             with self.subTest(arguments=arguments):
                 out, err = self.run_tool(*arguments, status=2)
                 self.assertEqual((out, err.splitlines()[0]), ("", f"bvhelperctl: {message}"))
-                self.assertEqual(self.json(*arguments, status=2), {"ok": False, "error": message})
+                answer = self.json(*arguments, status=2)
+                self.assertEqual(answer.pop("advice", ""), "\n".join(err.splitlines()[1:]))
+                self.assertEqual(answer, {"ok": False, "error": message})
 
     def test_help_and_version_are_no_failures(self):
         for arguments in (["--help"], ["prefs", "--help"], ["prefs", "set", "--help"], ["--version"]):
@@ -358,10 +394,17 @@ class Unusable(ToolTest):
             self.assertNotEqual(out, "")
             self.assertEqual(err, "")
 
-    def test_a_socket_path_that_is_too_long(self):
-        self.socket = self.folder / ("x" * 120)
-        _, err = self.run_tool("ping", status=2)
-        self.assertEqual(err, "bvhelperctl: --socket: the path is empty or too long for a socket\n")
+    def test_the_help_of_a_command_says_where_the_options_of_all_are(self):
+        hint = "--json, --timeout and --socket may stand here, too: see bvhelperctl --help."
+        for arguments, wanted in [([], False), (["prefs"], True), (["prefs", "set"], True), (["ping"], True)]:
+            out, _ = self.run_tool(*arguments, "--help")
+            self.assertEqual(hint in out, wanted, arguments)
+            self.assertIn("Exit status: 0 done;", out)
+
+    def test_a_socket_path_that_is_none(self):
+        for self.socket in (self.folder / ("x" * 120), ""):
+            _, err = self.run_tool("ping", status=2)
+            self.assertEqual(err, "bvhelperctl: --socket: the path is empty or too long for a socket\n")
 
 
 def push(message_id, values, reply_port=7):
