@@ -110,7 +110,9 @@ int reportCode(const Settings& settings, bvmh_client* client, const char* routin
   switch (code) {
     case BVMH_ERROR_UNREACHABLE:
       return fail(settings, kUnusable, "cannot reach the helper at " + printable(socketOf(settings)) + reason,
-                  "Is BrenvikMobileHelper installed, and its socket unit started?", fields);
+                  "Is BrenvikMobileHelper installed, and its socket unit started? systemctl status "
+                  "brenvik-mobile-helper.socket tells.",
+                  fields);
     case BVMH_ERROR_TIMED_OUT: {
       std::array<char, 32> seconds{};
       std::snprintf(seconds.data(), seconds.size(), "%g", settings.timeout);
