@@ -45,11 +45,6 @@ EntitlementCheck::EntitlementCheck(TaskSecurity& security, WorkQueues& queues)
 
 EntitlementCheck::~EntitlementCheck() { tearDown(); }
 
-EntitlementCheck& EntitlementCheck::processWide(TaskSecurity& security, WorkQueues& queues) {
-  static EntitlementCheck shared(security, queues);
-  return shared;
-}
-
 bool EntitlementCheck::HasEntitlement(std::string_view name, const AuditToken& caller) noexcept {
   const pid_t pid = caller.pid();
   {

@@ -34,9 +34,6 @@ class EntitlementCheck {
   std::size_t grants() const noexcept;
   std::size_t watchers() const noexcept;
 
-  // The process's one check, made on first use with the services of that first call and torn down at exit.
-  static EntitlementCheck& processWide(TaskSecurity& security, WorkQueues& queues);
-
  private:
   struct State;
   void remember(std::string_view name, const AuditToken& caller);

@@ -313,18 +313,6 @@ TEST_F(EntitlementCheckTest, TwoChecksKnowNothingOfEachOther) {
   EXPECT_EQ(security.questions(), 2);
 }
 
-TEST(ProcessWideEntitlementCheckTest, IsMadeOnFirstUseAndIsTheSameForEveryone) {
-  static ManualClock clock;  // these outlive the check, which is torn down at exit
-  static ManualWorkQueues queues(clock);
-  static FakeTaskSecurity security;
-  FakeTaskSecurity otherSecurity;
-  EntitlementCheck& check = EntitlementCheck::processWide(security, queues);
-  EXPECT_EQ(&EntitlementCheck::processWide(otherSecurity, queues), &check);
-  security.grant(tokenOf(7), kName, PropertyList::boolean(true));
-  EXPECT_TRUE(check.HasEntitlement(kName, tokenOf(7)));
-  EXPECT_EQ(otherSecurity.tasksWanted(), 0);
-}
-
 // Process-exit sources whose handlers run on whatever thread reports the exit; nothing else is used.
 class ThreadedExits final : public WorkQueues {
  public:
