@@ -33,8 +33,8 @@ class InstalledTree(unittest.TestCase):
         folder = tempfile.TemporaryDirectory(prefix="brenvik-tree-")
         cls.addClassCleanup(folder.cleanup)
         cls.root = pathlib.Path(folder.name)
-        cache = (BUILD / "CMakeCache.txt").read_text()
-        prefix = re.search(r"^CMAKE_INSTALL_PREFIX:\w+=/(.*)$", cache, flags=re.M)[1]
+        cls.cache = (BUILD / "CMakeCache.txt").read_text()
+        prefix = re.search(r"^CMAKE_INSTALL_PREFIX:\w+=/(.*)$", cls.cache, flags=re.M)[1]
         cls.install(cls.root)
         cls.prefix = cls.root / prefix
         cls.files = {str(each.relative_to(cls.prefix)) for each in cls.prefix.rglob("*") if not each.is_dir()}
@@ -51,8 +51,8 @@ class InstalledTree(unittest.TestCase):
 
     def test_programs_libraries_and_units_are_there(self):
         for pattern in (r"libexec/brenvik/BrenvikMobileHelper", r"libexec/brenvik/brenvik-archive-reader",
-                        r"lib.*/brenvik/brenvik-web\.so", r"share/brenvik/gazetteer\.db", r"bin/bvhelperctl",
-                        r"bin/brenvik-standin", r"lib.*/libbrenvik-mobile-helper\.a",
+                        r"lib.*/brenvik/brenvik-web\.so", r"bin/bvhelperctl", r"bin/brenvik-standin",
+                        r"lib.*/libbrenvik-mobile-helper\.a",
                         r"lib.*/libbrenvik-mobile-helper\.so", r"lib.*/libbrenvik-mobile-helper\.so\.0",
                         r"include/brenvik/mobile_helper\.h", r"lib.*/pkgconfig/brenvik-mobile-helper\.pc",
                         r"lib.*/cmake/BrenvikMobileHelper/BrenvikMobileHelperConfig\.cmake",
@@ -66,6 +66,11 @@ class InstalledTree(unittest.TestCase):
             self.one(pattern)
         self.assertTrue((self.root / "etc/brenvik/entitlements.d").is_dir())
         self.assertTrue((self.root / "usr/lib/brenvik/entitlements.d").is_dir())
+
+    def test_places_that_are_compiled_in_are_there_whatever_the_prefix(self):
+        for name in ("BRENVIK_GAZETTEER", "BRENVIK_ENTITLEMENT_DIRECTORIES"):
+            for place in re.search(rf"^{name}:\w+=(.*)$", self.cache, flags=re.M)[1].split(";"):
+                self.assertTrue((self.root / place.lstrip("/")).exists(), place)
 
     def test_installed_again_by_somebody_with_another_mask_it_is_the_same(self):
         def facts(root):
