@@ -3,6 +3,8 @@
 #include "helper/core/EntryPoint.h"
 
 #include <memory>
+#include <new>
+#include <utility>
 
 #include "platform/log/Log.h"
 
@@ -17,8 +19,16 @@ int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const R
   }
 
   int status = 1;
-  if (ServerContext* const server = CreateServer(platform, kServiceName, requests); server != nullptr) {
-    if (hosted != nullptr) SetIdleCheck(server, [hosted] { return hosted->isBusy(); });
+  ServerContext* server = CreateServer(platform, kServiceName, requests);
+  if (server != nullptr && hosted != nullptr) {
+    try {
+      SetIdleCheck(server, [hosted] { return hosted->isBusy(); });
+    } catch (const std::bad_alloc&) {
+      // Without the check a busy hosted server would be ended; not serving at all says what is wrong.
+      DestroyServer(std::exchange(server, nullptr));
+    }
+  }
+  if (server != nullptr) {
     RunServer(*server);
     endWork();
     DestroyServer(server);

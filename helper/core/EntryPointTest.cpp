@@ -4,6 +4,9 @@
 
 #include <gtest/gtest.h>
 
+#include <optional>
+
+#include "platform/base/fakes/FailingAllocations.h"
 #include "platform/baseband/fakes/FakeBaseband.h"
 #include "platform/ipc/fakes/FakePorts.h"
 #include "platform/log/fakes/RecordingLog.h"
@@ -109,6 +112,33 @@ TEST_F(EntryPointTest, AServiceThatCannotBeSetUpIsLoggedTwiceAndExitsWith1AfterS
   EXPECT_EQ(baseband.record, "canHost create start stop release ");
   EXPECT_EQ(loop.runs, 0);
   EXPECT_EQ(worksEnded, 0);
+}
+
+TEST_F(EntryPointTest, WithoutMemoryForTheServerTheHostedServerIsStoppedAndTheStatusIs1) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "nothing fails under this sanitizer";
+  std::optional<FailingAllocations> failing;
+  baseband.whenStarted = [&] { failing.emplace(0, FailingAllocations::HowMany::one); };
+  EXPECT_EQ(runHelper(baseband, platform, requests, endWork), 1);
+  failing.reset();
+  EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                               LogLevel::error, "unable to startup BrenvikMobileHelper server")});
+  EXPECT_EQ(baseband.record, "canHost create start stop release ");
+  EXPECT_EQ(loop.runs, 0);
+}
+
+TEST_F(EntryPointTest, WithoutMemoryForTheIdleCheckNothingIsServedAndTheStatusIs1) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "nothing fails under this sanitizer";
+  bootstrap.name.reserve(64);
+  std::optional<FailingAllocations> failing;
+  // After six of the server and the fakes that it is made with.
+  baseband.whenStarted = [&] { failing.emplace(6, FailingAllocations::HowMany::one); };
+  EXPECT_EQ(runHelper(baseband, platform, requests, endWork), 1);
+  failing.reset();
+  ASSERT_EQ(sources.routineSources.size(), 1U) << "the server had been made";
+  EXPECT_FALSE(sources.routineSources[0]->valid);
+  EXPECT_EQ(registry.size(), 0U);
+  EXPECT_EQ(baseband.record, "canHost create start stop release ");
+  EXPECT_EQ(loop.runs, 0);
 }
 
 }  // namespace

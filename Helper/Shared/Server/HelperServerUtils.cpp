@@ -87,17 +87,25 @@ void TearDownClient(ServerContext& server, const std::shared_ptr<DeathWatch>& de
 
 ServerContext* CreateServer(const ServerPlatform& platform, const char* serviceName,
                             const RoutineTable& clientSubsystem) {
-  auto* const server = new (std::nothrow) ServerContext(platform, clientSubsystem);
-  if (server == nullptr) return nullptr;
+  ServerContext* server = nullptr;
+  try {
+    server = new ServerContext(platform, clientSubsystem);
+  } catch (const std::bad_alloc&) {
+    return nullptr;
+  }
 
   PortName port = kNullPort;
-  if (platform.bootstrap.checkIn(serviceName, &port) == kern::success) {
-    server->servicePort = port;
-    platform.registry.add(port, server);
-    server->checkInSubsystem = makeCheckInTable(platform);
-    server->serviceSource =
-        platform.sources.makeRoutineSource(port, *server->checkInSubsystem, WantTrailer::yes);
-    if (server->serviceSource != nullptr && server->serviceSource->addTo(platform.loop)) return server;
+  try {
+    if (platform.bootstrap.checkIn(serviceName, &port) == kern::success) {
+      server->servicePort = port;
+      platform.registry.add(port, server);
+      server->checkInSubsystem = makeCheckInTable(platform);
+      server->serviceSource =
+          platform.sources.makeRoutineSource(port, *server->checkInSubsystem, WantTrailer::yes);
+      if (server->serviceSource != nullptr && server->serviceSource->addTo(platform.loop)) return server;
+    }
+  } catch (const std::bad_alloc&) {
+    // Out of resources, as the line says.
   }
   // After a successful check-in DestroyServer drops the same right again, to no effect.
   if (isUsablePort(port)) (void)platform.ports.dropReceiveRight(port);

@@ -7,6 +7,7 @@
 #include <array>
 #include <cstring>
 
+#include "platform/base/fakes/FailingAllocations.h"
 #include "platform/ipc/fakes/FakePorts.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
@@ -97,6 +98,33 @@ TEST_F(ServerTest, AServiceSourceThatTheLoopRefusesFailsTheCreation) {
   sources.refuseToBeAdded = true;
   EXPECT_EQ(CreateServer(platform, kServiceName, routines), nullptr);
   EXPECT_TRUE(ports.receiveRights.empty());
+}
+
+TEST_F(ServerTest, WithoutMemoryForTheContextCreationReturnsNullWithoutALine) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "nothing fails under this sanitizer";
+  {
+    const FailingAllocations failing(0, FailingAllocations::HowMany::one);
+    EXPECT_EQ(CreateServer(platform, kServiceName, routines), nullptr);
+  }
+  EXPECT_TRUE(log.entries().empty());
+  EXPECT_EQ(bootstrap.name, "") << "the service name was not asked for";
+}
+
+TEST_F(ServerTest, WithoutMemoryToServeThePortCreationFailsAsOutOfResourcesAndLeavesNothing) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "nothing fails under this sanitizer";
+  bootstrap.name.reserve(64);
+  // After the context and the fake's receive right: the registry's entry, then the table of the port.
+  for (const long number : {2, 3}) {
+    log.clear();
+    {
+      const FailingAllocations failing(number, FailingAllocations::HowMany::one);
+      EXPECT_EQ(CreateServer(platform, kServiceName, routines), nullptr);
+    }
+    EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                                 LogLevel::error, "unable to create server objects - out of resources")});
+    EXPECT_EQ(registry.size(), 0U);
+    EXPECT_TRUE(ports.receiveRights.empty());
+  }
 }
 
 TEST_F(ServerTest, DestructionTearsEveryClientDownAndGivesThePortBack) {

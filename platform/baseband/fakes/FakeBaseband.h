@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <functional>
 #include <string>
 
 #include "platform/baseband/HostedBasebandServer.h"
@@ -26,6 +27,7 @@ class FakeBasebandLibrary final : public BasebandLibrary {
   bool makesServer = true;
   bool busy = false;
   int busyQuestions = 0;
+  std::function<void()> whenStarted;
   std::string record;  // words, each followed by a blank
 
  private:
@@ -35,7 +37,10 @@ class FakeBasebandLibrary final : public BasebandLibrary {
     Server(const Server&) = delete;
     Server& operator=(const Server&) = delete;
     ~Server() override { library_.record += "release "; }
-    void start() override { library_.record += "start "; }
+    void start() override {
+      library_.record += "start ";
+      if (library_.whenStarted) library_.whenStarted();
+    }
     bool isBusy() override {
       ++library_.busyQuestions;
       return library_.busy;
