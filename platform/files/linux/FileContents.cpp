@@ -50,6 +50,16 @@ bool meansUnsupported(int error) {
 
 }  // namespace
 
+int writeAll(int file, std::string_view bytes) noexcept {
+  while (!bytes.empty()) {
+    const ssize_t put = ::write(file, bytes.data(), bytes.size());
+    if (put < 0 && errno == EINTR) continue;
+    if (put < 0) return errno;
+    bytes.remove_prefix(static_cast<std::size_t>(put));
+  }
+  return 0;
+}
+
 char* FileContents::buffer() {
   // On a page's start: from elsewhere the kernel's copying takes 1.7 times as long.
   if (!buffer_) buffer_.reset(static_cast<char*>(std::aligned_alloc(kPageSize, kBufferSize)));

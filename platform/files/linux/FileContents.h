@@ -6,8 +6,12 @@
 
 #include <cstdlib>
 #include <memory>
+#include <string_view>
 
 namespace brenvik {
+
+// Writes all the bytes at the file's position. 0 or errno. Any thread.
+int writeAll(int file, std::string_view bytes) noexcept;
 
 // Copies what a file is beside its name: its data, and its attributes. Keeps a buffer and what it learned
 // about the file systems between calls; make one for a request. One thread.

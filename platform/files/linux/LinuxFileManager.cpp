@@ -14,6 +14,7 @@
 #include <new>
 
 #include "platform/files/linux/DirectoryNames.h"
+#include "platform/files/linux/FileContents.h"
 #include "platform/files/linux/HeldDirectory.h"
 #include "platform/files/linux/Placement.h"
 #include "platform/files/linux/TreeCopier.h"
@@ -52,16 +53,6 @@ bool isInside(int directory, const struct stat& tree) {
     at = current.get();
   }
   return true;
-}
-
-int writeAll(int file, std::string_view bytes) {
-  while (!bytes.empty()) {
-    const ssize_t put = ::write(file, bytes.data(), bytes.size());
-    if (put < 0 && errno == EINTR) continue;
-    if (put < 0) return errno;
-    bytes.remove_prefix(static_cast<std::size_t>(put));
-  }
-  return 0;
 }
 
 int idOfUser(std::string_view name, uid_t* uid) {

@@ -15,6 +15,7 @@
 
 #include "platform/files/archive/ArchiveEntryPath.h"
 #include "platform/files/archive/ResourceCompanion.h"
+#include "platform/files/linux/FileContents.h"
 
 namespace brenvik {
 
@@ -54,16 +55,6 @@ UniqueFd openBeneath(int top, const char* path, int flags) {
   } while (fd < 0 && (errno == EAGAIN || errno == EINTR));  // EAGAIN: a rename crossed the walk
   if (fd < 0 && errno == ENOSYS) return walkBeneath(top, path, flags);
   return UniqueFd(static_cast<int>(fd));
-}
-
-int writeAll(int file, std::string_view bytes) {
-  while (!bytes.empty()) {
-    const ssize_t put = ::write(file, bytes.data(), bytes.size());
-    if (put < 0 && errno == EINTR) continue;
-    if (put < 0) return errno;
-    bytes.remove_prefix(static_cast<std::size_t>(put));
-  }
-  return 0;
 }
 
 // An entry's own fault, which the handler may pass over; everything else is the disk's.
