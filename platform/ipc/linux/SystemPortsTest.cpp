@@ -15,6 +15,7 @@
 
 #include <algorithm>
 #include <array>
+#include <atomic>
 #include <chrono>
 #include <cstdlib>
 #include <cstring>
@@ -634,8 +635,11 @@ TEST_F(PortsTest, AFullChannelDelaysItsOwnRepliesOnlyAndIsNotReadUntilTheyHaveGo
 
 TEST_F(PortsTest, InvalidatingASourceReleasesTheReplyThatWaited) {
   const Datagram large = message(kRegion).add(kNdrRecord).add(60000U);
-  for (int i = 0; i < 20; ++i) (void)sendTo(client.get(), large);
-  pump();
+  // Until one waits; how many go before is up to the system's buffers.
+  for (int i = 0; i < 10'000 && regions.live() == 0; ++i) {
+    ASSERT_TRUE(sendTo(client.get(), large));
+    pump();
+  }
   EXPECT_EQ(regions.live(), 1U);
   source->invalidate();
   EXPECT_EQ(regions.live(), 0U);
@@ -799,14 +803,15 @@ TEST_F(ServiceTest, ANameThatALiveProcessHoldsIsRefusedAndSaidWhy) {
 TEST_F(ServiceTest, WhoeverStartsAtTheSameTimeWaitsForTheOtherToBeDone) {
   const UniqueFd lock(::open((directory + "/.service.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
   ASSERT_EQ(::flock(lock.get(), LOCK_EX), 0);
-  std::thread other([&lock] {
+  std::atomic<bool> isDone = false;
+  std::thread other([&] {
     std::this_thread::sleep_for(30ms);
+    isDone = true;
     ::flock(lock.get(), LOCK_UN);
   });
-  const auto started = std::chrono::steady_clock::now();
   listen();
+  EXPECT_TRUE(isDone);
   other.join();
-  EXPECT_GE(std::chrono::steady_clock::now() - started, 30ms);
   EXPECT_TRUE(connect().isValid());
 }
 
