@@ -14,9 +14,6 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-// For everything: connecting, authenticating, the call and its answer.
-constexpr std::chrono::seconds kPatience{1};
-
 struct BusCloser {
   // Without the flush that sd-bus offers: that could wait for a bus that does not read.
   void operator()(sd_bus* bus) const noexcept { sd_bus_close_unref(bus); }
@@ -39,8 +36,8 @@ int takeAnswer(sd_bus_message*, void* answered, sd_bus_error*) {
 }
 
 // A bus that is absent, refuses or keeps silent changes nothing for anybody, so every failure just ends it.
-void setLogging(const char* busAddress, const char* level) noexcept {
-  const auto deadline = Clock::now() + kPatience;
+void setLogging(const char* busAddress, const char* level, std::chrono::milliseconds patience) noexcept {
+  const auto deadline = Clock::now() + patience;
   sd_bus* opened = nullptr;
   if (sd_bus_new(&opened) < 0) return;
   const std::unique_ptr<sd_bus, BusCloser> bus(opened);
@@ -75,11 +72,13 @@ void setLogging(const char* busAddress, const char* level) noexcept {
 struct ModemManagerLogs::Switch {
   enum Position : int { unchanged, off, on };
   const std::string busAddress;
+  const std::chrono::milliseconds patience;
   std::atomic<Position> wanted{unchanged};
 };
 
-ModemManagerLogs::ModemManagerLogs(WorkQueues& queues, std::string busAddress)
-    : queues_(queues), switch_(new Switch{std::move(busAddress)}) {}
+ModemManagerLogs::ModemManagerLogs(WorkQueues& queues, std::string busAddress,
+                                   std::chrono::milliseconds patience)
+    : queues_(queues), switch_(new Switch{std::move(busAddress), patience}) {}
 
 ModemManagerLogs::~ModemManagerLogs() = default;
 
@@ -91,7 +90,7 @@ void ModemManagerLogs::setLogToFile(bool enable) noexcept {
     queue_->post([state = switch_] {
       const auto wanted = state->wanted.exchange(Switch::unchanged);
       if (wanted == Switch::unchanged) return;
-      setLogging(state->busAddress.c_str(), wanted == Switch::on ? "DEBUG" : "INFO");
+      setLogging(state->busAddress.c_str(), wanted == Switch::on ? "DEBUG" : "INFO", state->patience);
     });
   } catch (const std::exception&) {
     switch_->wanted = Switch::unchanged;  // no memory or no thread: the next switch tries again

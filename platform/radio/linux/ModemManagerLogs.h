@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <chrono>
 #include <memory>
 #include <string>
 
@@ -16,8 +17,10 @@ namespace brenvik {
 // while that lasts is remembered, the last position only. Main loop only.
 class ModemManagerLogs final : public RadioManager {
  public:
-  // The bus is the system bus unless a test brings its own. `queues` must outlive this object.
-  explicit ModemManagerLogs(WorkQueues& queues, std::string busAddress = kSystemBus);
+  // The bus is the system bus and the patience kPatience unless a test brings its own. `queues` must outlive
+  // this object.
+  explicit ModemManagerLogs(WorkQueues& queues, std::string busAddress = kSystemBus,
+                            std::chrono::milliseconds patience = kPatience);
   ModemManagerLogs(const ModemManagerLogs&) = delete;
   ModemManagerLogs& operator=(const ModemManagerLogs&) = delete;
   // Waits for a call under way: up to one second.
@@ -27,6 +30,8 @@ class ModemManagerLogs final : public RadioManager {
 
   // Fixed, so that nothing in the environment can point the helper elsewhere.
   static constexpr const char* kSystemBus = "unix:path=/run/dbus/system_bus_socket";
+  // For everything that one switch does: connecting, authenticating, the call and its answer.
+  static constexpr std::chrono::milliseconds kPatience{1000};
 
  private:
   struct Switch;
