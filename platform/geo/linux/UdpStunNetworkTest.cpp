@@ -42,7 +42,14 @@ class Server {
                                              : reinterpret_cast<sockaddr_in6&>(address).sin6_port;
     name = (family == AF_INET ? "127.0.0.1:" : "[::1]:") + std::to_string(ntohs(port));
   }
-  void close() { socket_.reset(); }
+  // To everybody else the port is closed now: a socket that is connected, here to itself, hears one peer
+  // only. Its number is not free, so nobody else's server can turn up there.
+  void refuse() {
+    sockaddr_storage own{};
+    socklen_t size = sizeof own;
+    ASSERT_EQ(::getsockname(socket_.get(), reinterpret_cast<sockaddr*>(&own), &size), 0);
+    ASSERT_EQ(::connect(socket_.get(), reinterpret_cast<const sockaddr*>(&own), size), 0);
+  }
   // Takes one request, and sends what `answers` makes of it and of its sender's address (as in the answer,
   // xor'ed).
   void serveOne(
@@ -155,7 +162,7 @@ TEST_F(UdpStunNetworkTest, ASecondSendingReachesAServerThatMissedTheFirst) {
 
 TEST_F(UdpStunNetworkTest, APortWhereNobodyListensEndsItAtOnce) {
   Server server;
-  server.close();
+  server.refuse();
   EXPECT_EQ(problemOf(ask(server.name)), "the STUN server cannot be reached");
 }
 
@@ -202,11 +209,14 @@ TEST(HostResolverTest, FindsTheLoopbackByName) {
 TEST(HostResolverTest, WithoutPatienceOnlyNumbersAreResolved) {
   EXPECT_EQ(resolveUdp({"127.0.0.1", "1"}, 0s, -1).size(), 1U);
   EXPECT_TRUE(resolveUdp({"localhost", "1"}, -1s, -1).empty());
+  // The look-up that was not waited for is joined, so that it is in no other's way.
+  EXPECT_FALSE(resolveUdp({"localhost", "1"}, 20s, -1).empty());
 }
 
 TEST(HostResolverTest, StoppingEndsTheWaitingForAName) {
   const UniqueFd stop(::eventfd(1, EFD_CLOEXEC));
   EXPECT_TRUE(resolveUdp({"localhost", "2"}, 20s, stop.get()).empty());
+  EXPECT_FALSE(resolveUdp({"localhost", "2"}, 20s, -1).empty());
 }
 
 }  // namespace

@@ -140,11 +140,10 @@ class HttpsServer {
     void finishTls() {
       if (tls_ != nullptr) (void)SSL_shutdown(tls_.get());
     }
-    // The client gets a reset instead of an end.
+    // The client gets a reset instead of an end, when the script ends.
     void reset() {
       const linger abrupt{1, 0};
       (void)::setsockopt(fd_.get(), SOL_SOCKET, SO_LINGER, &abrupt, sizeof abrupt);
-      fd_.reset();
     }
     // Says nothing until the client goes or the server ends.
     void stall() {

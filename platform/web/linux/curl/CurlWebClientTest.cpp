@@ -290,11 +290,15 @@ TEST_F(CurlWebClientTest, UrlsThatCannotBeUsedMakeNoRequest) {
 // ---- failures: the completion always comes ----
 
 TEST_F(CurlWebClientTest, ARefusedConnectionIsTold) {
-  std::uint16_t port = 0;
-  {
-    port = HttpsServer(identity, [](Connection&) {}).port();
-  }
-  const auto response = fetch("https://127.0.0.1:" + std::to_string(port) + "/");
+  // Bound, so that nobody else can listen there, and not listening.
+  const UniqueFd taken(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  sockaddr_in self{};
+  self.sin_family = AF_INET;
+  self.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t size = sizeof self;
+  ASSERT_EQ(::bind(taken.get(), reinterpret_cast<sockaddr*>(&self), size), 0);
+  ASSERT_EQ(::getsockname(taken.get(), reinterpret_cast<sockaddr*>(&self), &size), 0);
+  const auto response = fetch("https://127.0.0.1:" + std::to_string(ntohs(self.sin_port)) + "/");
   expectKind(WebErrorKind::cannotConnect, response);
   EXPECT_EQ(response->statusCode, 0);
 }
@@ -613,7 +617,6 @@ class CurlWebClientNetworkTest : public CurlWebClientTest {
   void SetUp() override {
     if (!ours.isMade() || !theirs.isMade()) GTEST_SKIP() << "no permission to make a network namespace";
     ASSERT_TRUE(ours.ip("link set lo up"));
-    settings.connectLimit = 300ms;
     settings.cellularFiles.nameServers = folder / "resolv.conf";
     settings.cellularFiles.hosts = folder / "hosts";
     std::ofstream(settings.cellularFiles.nameServers) << "nameserver 203.0.113.53\n";
@@ -694,14 +697,15 @@ TEST_F(CurlWebClientNetworkTest, WithoutARouteThereIsNoConnection) {
 }
 
 TEST_F(CurlWebClientNetworkTest, ANameServerThatIsDeadOrOutOfReachDoesNotHoldTheCompletion) {
-  const auto before = std::chrono::steady_clock::now();
+  settings.connectLimit = 300ms;
   const auto unreachable = outcome("https://lasd.example/", false);
   EXPECT_TRUE(unreachable == WebErrorKind::hostNotFound || unreachable == WebErrorKind::timedOut);
   join("wifi0", 2);
   // Its neighbour never answers, so neither does the name server of this machine's own configuration.
   ASSERT_TRUE(ours.ip("route add default via 10.7.2.9"));
+  const auto before = std::chrono::steady_clock::now();
   EXPECT_EQ(outcome("https://lasd.example/", false), WebErrorKind::timedOut);
-  EXPECT_LT(std::chrono::steady_clock::now() - before, 5s);
+  EXPECT_LT(std::chrono::steady_clock::now() - before, 8s) << "the look-up itself takes ten";
 }
 
 }  // namespace
