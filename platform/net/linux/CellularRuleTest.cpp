@@ -108,6 +108,7 @@ TEST_F(CellularRuleTest, TheInterfaceOfTheRouteIsChosenAndACellularOneIsNot) {
 }
 
 TEST_F(CellularRuleTest, RoutesOfIpVersion6AreAskedForTooAndAScopeNamesTheInterface) {
+  if (!network.ip("-6 address add 2001:db8::1/128 dev lo nodad 2> /dev/null")) GTEST_SKIP() << "no IPv6 here";
   addInterface("wifi0", 1);
   addInterface("pdp_ip0", 2);
   ASSERT_TRUE(network.ip("-6 address add 2001:db8:1::1/64 dev wifi0 nodad"));

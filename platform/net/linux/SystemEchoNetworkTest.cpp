@@ -49,7 +49,7 @@ class SystemEchoNetworkTest : public testing::Test {
   }
   // Sends a request and returns what comes back, after the IP header if there is one.
   std::vector<std::byte> exchange(EchoSocket& socket, const char* address) {
-    EXPECT_EQ(socket.setReceiveTimeOut(1s), 0);
+    EXPECT_EQ(socket.setReceiveTimeOut(20s), 0);
     const auto sent = socket.sendTo(in_addr{::inet_addr(address)}, request(kIdentifier));
     EXPECT_EQ(sent.count, 48) << sent.error;
     std::array<std::byte, 2048> buffer;
