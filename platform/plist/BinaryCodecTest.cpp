@@ -6,6 +6,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cmath>
 #include <ctime>
 #include <functional>
@@ -66,11 +67,16 @@ constexpr long kHeldBack =
 constexpr long kHeldBack = 0;
 #endif
 
-// Of this process, which other work on the machine does not lengthen.
-double processorSeconds(const std::function<void()>& work) {
-  const std::clock_t start = std::clock();
-  work();
-  return static_cast<double>(std::clock() - start) / CLOCKS_PER_SEC;
+// Of this process, which other work on the machine does not lengthen. A virtual machine that stands still
+// may, so where it is more than `enough` the work is done again: the least of three counts.
+double processorSeconds(double enough, const std::function<void()>& work) {
+  double least = HUGE_VAL;
+  for (int i = 0; i < 3 && least >= enough; ++i) {
+    const std::clock_t start = std::clock();
+    work();
+    least = std::min(least, static_cast<double>(std::clock() - start) / CLOCKS_PER_SEC);
+  }
+  return least;
 }
 
 // Most memory, in KiB, that a process of its own needs for the work beyond what it needs for none.
@@ -316,7 +322,7 @@ TEST(BinaryReaderTest, RefusesATinyFileThatWouldBeHugeAsXmlAtOnceAndInLittleMemo
   ASSERT_LT(hundredsOfMegabytes.size(), 140u);
   const std::string beyondCounting = bomb(200, 30);
   for (const std::string& hostile : {hundredsOfMegabytes, beyondCounting, bomb(250, 2), bomb(60, 100)}) {
-    EXPECT_LT(processorSeconds([&] { EXPECT_FALSE(parse(hostile)); }), 0.5);
+    EXPECT_LT(processorSeconds(0.5, [&] { EXPECT_FALSE(parse(hostile)); }), 0.5);
     EXPECT_LT(peakMemory([&] { (void)parse(hostile); }), 4 * 1024);
   }
   EXPECT_TRUE(parse(bomb(4, 10))) << "sharing within the limit is fine";
@@ -520,7 +526,7 @@ TEST(BinaryWriterTest, AnExponentialValueIsRefusedInBothFormatsAtOnce) {
   PropertyList value = PropertyList::array({PropertyList::array({})});
   for (int i = 0; i < 400; ++i) value = PropertyList::array({value, value});
   for (const PropertyListFormat format : {PropertyListFormat::xml, PropertyListFormat::binary}) {
-    EXPECT_LT(processorSeconds([&] { EXPECT_FALSE(serializePropertyList(value, format)); }), 10);
+    EXPECT_LT(processorSeconds(10, [&] { EXPECT_FALSE(serializePropertyList(value, format)); }), 10);
   }
 }
 
