@@ -7,6 +7,7 @@
 #include <sys/mman.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -25,6 +26,12 @@
 
 #include "client/fakes/ScriptedHelper.h"
 #include "client/include/brenvik/mobile_helper.h"
+#include "platform/base/fakes/FailingCalls.h"
+
+extern "C" int connect(int socket, const sockaddr* address, socklen_t size) {
+  if (brenvik::FailingCall::failsNow("connect")) return -1;
+  return static_cast<int>(::syscall(SYS_connect, socket, address, size));
+}
 
 // Connecting, waiting, and a helper that leaves, is late or lies.
 namespace brenvik::client {
@@ -141,17 +148,14 @@ TEST(ClientTest, TriesAgainWhileTheSocketIsMissingBetweenTwoLivesOfTheHelper) {
   std::unique_ptr<ScriptedHelper> first;
   first = std::make_unique<ScriptedHelper>([&](Script& script) {
     const UniqueFd connection = script.accept();
-    // The file goes before the connection does, and is back some tries later.
     ASSERT_EQ(::unlink(path.c_str()), 0);
+    ASSERT_EQ(::symlink(second.path().c_str(), path.c_str()), 0);
   });
   ASSERT_EQ(::symlink(first->path().c_str(), path.c_str()), 0);
   const ClientPointer client = clientFor(path);
-  std::thread restart([&] {
-    first->finish();
-    ASSERT_EQ(::symlink(second.path().c_str(), path.c_str()), 0);
-  });
+  const FailingCall missing("connect", ENOENT, 1);  // after the first helper and before the second
   EXPECT_EQ(bvmh_connect(client.get()), BVMH_OK);
-  restart.join();
+  EXPECT_EQ(missing.failures(), 1);
 }
 
 TEST(ClientTest, SaysAtOnceThatNobodyIsThere) {
