@@ -236,8 +236,10 @@ TEST_F(CarrierFaultsTest, WhereTheDiskEndsInTheMiddleNothingHalfStays) {
 
 TEST_F(CarrierFaultsTest, WhereWritingIsForbiddenEveryRoutineFailsAndChangesNothing) {
   if (::geteuid() != 0) GTEST_SKIP() << "becomes another user";
+  const mode_t mask = ::umask(022);  // who may look at everything
   makeSources();
   makeHome("home");
+  ::umask(mask);
   ASSERT_EQ(::chmod(dir.path().c_str(), 0755), 0);
   const std::set<std::string> before = everythingIn(dir.path());
   const pid_t child = ::fork();
