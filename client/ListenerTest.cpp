@@ -26,7 +26,7 @@
 namespace brenvik::client {
 namespace {
 
-constexpr int kPlenty = 10'000;  // milliseconds
+constexpr int kPlenty = 60'000;  // milliseconds
 
 struct FreeListener {
   void operator()(bvmh_listener* listener) const { bvmh_listener_free(listener); }

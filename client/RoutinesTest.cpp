@@ -25,7 +25,7 @@ using ClientPointer = std::unique_ptr<bvmh_client, FreeClient>;
 ClientPointer connectedTo(const ScriptedHelper& helper) {
   ClientPointer client(bvmh_client_create());
   EXPECT_EQ(bvmh_client_set_socket(client.get(), helper.path().c_str()), BVMH_OK);
-  bvmh_client_set_timeout(client.get(), 10'000);
+  bvmh_client_set_timeout(client.get(), 60'000);
   EXPECT_EQ(bvmh_connect(client.get()), BVMH_OK);
   return client;
 }

@@ -20,7 +20,7 @@
 namespace brenvik::client {
 namespace {
 
-constexpr int kPatience = 10'000;  // milliseconds; only a broken client makes a script wait so long
+constexpr int kPatience = 60'000;  // milliseconds; only a broken client makes a script wait so long
 constexpr std::size_t kMostDescriptors = 16;
 
 [[noreturn]] void fail(const char* what) { throw std::system_error(errno, std::generic_category(), what); }

@@ -69,7 +69,7 @@ inline constexpr int kAllSeals = 0x2 | 0x4 | 0x8;  // shrink, grow, write
 
 class Script {
  public:
-  // Each waits for at most ten seconds and throws when what it waits for does not come.
+  // Each waits for at most a minute and throws when what it waits for does not come.
   UniqueFd accept();
   Message receive(const UniqueFd& channel);
   void expectEnd(const UniqueFd& channel);

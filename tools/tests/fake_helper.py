@@ -104,7 +104,7 @@ class FakeHelper:
     def close(self):
         # Wakes the accepting thread.
         self.listening.shutdown(socket.SHUT_RDWR)
-        self.thread.join(10)
+        self.thread.join(60)
         self.listening.close()
 
     def __enter__(self):

@@ -437,7 +437,7 @@ class Events(ToolTest):
     def send(self, service, message):
         sock = socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET)
         self.addCleanup(sock.close)
-        sock.settimeout(10)
+        sock.settimeout(60)
         sock.connect(str(self.folder / service))
         sock.send(message)
         return sock
@@ -456,7 +456,7 @@ class Events(ToolTest):
             self.send("com.norvale.Brenvik.lasd", notification(UPDATE)).close()
             self.assertEqual(program.stdout.readline(),
                              'notification Notification="com.norvale.lasd.UpdateAvailable" DBType="gsm"\n')
-            self.assertEqual(program.wait(10), 0)
+            self.assertEqual(program.wait(60), 0)
             self.assertEqual(list(self.folder.iterdir()), [])
 
     def test_json_lines(self):
@@ -469,14 +469,14 @@ class Events(ToolTest):
             self.send("com.norvale.Brenvik.lasd", notification(UPDATE))
             line = json.loads(program.stdout.readline())
             self.assertEqual((line["event"], line["values"], line["answer"]), ("notification", UPDATE, "none"))
-            self.assertEqual(program.wait(10), 0)
+            self.assertEqual(program.wait(60), 0)
 
     def test_the_stand_in_refuses(self):
         program = self.start("brenvik-standin", "--refuse", "13", "--count", "1")
         reply = self.send("com.norvale.brenvik", push(9100001, CIVIC)).recv(100)
         self.assertEqual(struct.unpack_from("<iII", reply, 32), (13, 0, 13))
         self.assertIn("(answer: refused with 13)", program.stdout.readline())
-        self.assertEqual(program.wait(10), 0)
+        self.assertEqual(program.wait(60), 0)
 
     def test_the_stand_in_hangs(self):
         program = self.start("brenvik-standin", "--hang")
@@ -486,13 +486,13 @@ class Events(ToolTest):
         with self.assertRaises(BlockingIOError):
             sock.recv(100)
         program.send_signal(signal.SIGINT)
-        self.assertEqual(program.wait(10), 0)
+        self.assertEqual(program.wait(60), 0)
 
     def test_signals_end_it_cleanly(self):
         for number in (signal.SIGINT, signal.SIGTERM):
             program = self.start("bvhelperctl", "watch")
             program.send_signal(number)
-            self.assertEqual(program.wait(10), 0)
+            self.assertEqual(program.wait(60), 0)
             self.assertEqual(list(self.folder.iterdir()), [])
 
     def test_only_one_listens(self):

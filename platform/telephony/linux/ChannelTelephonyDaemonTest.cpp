@@ -115,14 +115,14 @@ void sendReply(const UniqueFd& channel, const TelephonyPushReply& reply) {
 class ChannelTelephonyDaemonTest : public testing::Test {
  protected:
   // Pushes an address while `serve` plays the daemon on the accepted channel.
-  TelephonyResult pushAddress(std::function<void(UniqueFd)> serve, milliseconds patience = 10s) {
+  TelephonyResult pushAddress(std::function<void(UniqueFd)> serve, milliseconds patience = 60s) {
     service.listen();
     ChannelTelephonyDaemon daemon(service.directory, patience);
     daemon.addIdentifierException("BrenvikMobileHelper");
     std::thread brenvik([&] { serve(service.accept()); });
     auto connection = daemon.create([this] { ++callbacks; });
     // With little patience, a busy machine may be too late to connect.
-    for (int i = 0; i < 100 && connection == nullptr && patience < 10s; ++i) {
+    for (int i = 0; i < 100 && connection == nullptr && patience < 60s; ++i) {
       connection = daemon.create([this] { ++callbacks; });
     }
     EXPECT_NE(connection, nullptr);
@@ -137,7 +137,7 @@ class ChannelTelephonyDaemonTest : public testing::Test {
 
 TEST_F(ChannelTelephonyDaemonTest, CivicInfoTravelsAsOneComplexMessageWithItsRegionInLine) {
   service.listen();
-  ChannelTelephonyDaemon daemon(service.directory, 10s);
+  ChannelTelephonyDaemon daemon(service.directory, 60s);
   daemon.addIdentifierException("BrenvikMobileHelper");
   Received request;
   std::thread brenvik([&] {
@@ -186,7 +186,7 @@ TEST_F(ChannelTelephonyDaemonTest, TheAddressTravelsUnderItsOwnId) {
 
 TEST_F(ChannelTelephonyDaemonTest, TheClientIsNamedOnceHoweverManyPushesThereWere) {
   service.listen();
-  ChannelTelephonyDaemon daemon(service.directory, 10s);
+  ChannelTelephonyDaemon daemon(service.directory, 60s);
   std::vector<Received> requests;
   std::thread brenvik([&] {
     for (int i = 0; i < 3; ++i) {
@@ -294,7 +294,7 @@ TEST_F(ChannelTelephonyDaemonTest, AChannelThatClosesFirstIsABrokenPipe) {
 
 TEST_F(ChannelTelephonyDaemonTest, AChannelClosedBeforeThePushIsABrokenPipe) {
   service.listen();
-  ChannelTelephonyDaemon daemon(service.directory, 10s);
+  ChannelTelephonyDaemon daemon(service.directory, 60s);
   auto connection = daemon.create({});
   ASSERT_NE(connection, nullptr);
   service.accept().reset();
@@ -354,13 +354,13 @@ TEST_F(ChannelTelephonyDaemonTest, ADaemonThatAcceptsNobodyCostsNoMoreThanThePat
 
 TEST_F(ChannelTelephonyDaemonTest, APushThatFitsNoDatagramIsRefusedHere) {
   service.listen();
-  ChannelTelephonyDaemon daemon(service.directory, 10s);
+  ChannelTelephonyDaemon daemon(service.directory, 60s);
   EXPECT_EQ(errorCodeOf(daemon.create({})->setLocalRoutableAddress(std::string(70000, 'x'))), EMSGSIZE);
 }
 
 TEST_F(ChannelTelephonyDaemonTest, ConnectionsFromManyThreadsAreIndependent) {
   service.listen(64);
-  ChannelTelephonyDaemon daemon(service.directory, 10s);
+  ChannelTelephonyDaemon daemon(service.directory, 60s);
   std::thread brenvik([&] {
     for (int i = 0; i < 32; ++i) {
       const UniqueFd channel = service.accept();

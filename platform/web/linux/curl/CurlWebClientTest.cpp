@@ -110,8 +110,8 @@ class CurlWebClientTest : public testing::Test {
     folder = pattern;
     settings.certificateAuthorities = folder / "authority.pem";
     authority.writeCertificate(settings.certificateAuthorities);
-    settings.connectLimit = 10s;
-    settings.stallLimit = 10s;
+    settings.connectLimit = 60s;
+    settings.stallLimit = 60s;
   }
   ~CurlWebClientTest() override {
     client.reset();
@@ -521,6 +521,7 @@ TEST_F(CurlWebClientTest, RedirectsThatDoNotEndAreGivenUp) {
 TEST_F(CurlWebClientTest, ManyRequestsAtOnceEachCompleteOnce) {
   HttpsServer server(identity, [](Connection& connection) {
     const auto request = connection.readRequest();
+    if (request.empty()) return;
     if (request.find("/reset") != std::string::npos) return connection.reset();
     connection.respond("200 OK", request.substr(4, request.find(' ', 4) - 4));
   });
