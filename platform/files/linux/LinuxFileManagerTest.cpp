@@ -554,8 +554,10 @@ TEST_F(LinuxFileManagerTest, OnAFullDiskACopyLeavesTheOldFileAndNothingElse) {
 
 TEST_F(LinuxFileManagerTest, WhereWritingIsForbiddenNothingChanges) {
   if (::geteuid() != 0) GTEST_SKIP() << "becomes another user";
+  const mode_t mask = ::umask(022);
   dir.file("file", "new");
   dir.file("locked/file", "old");
+  ::umask(mask);
   ASSERT_EQ(::chmod(dir.path().c_str(), 0755), 0);
   const pid_t child = ::fork();
   if (child == 0) {
