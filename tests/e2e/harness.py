@@ -198,6 +198,11 @@ class Daemon:
                 names.append(pathlib.Path(f"/proc/{self.pid}/task/{task}/comm").read_text().strip())
         return sorted(names)
 
+    def cpu_seconds(self):
+        """What it has computed so far, which no other work of the machine makes more."""
+        fields = pathlib.Path(f"/proc/{self.pid}/stat").read_text().rsplit(")", 1)[1].split()
+        return sum(map(int, fields[11:13])) / os.sysconf("SC_CLK_TCK")
+
     def resident_kib(self):
         return int(re.search(r"VmRSS:\s+(\d+)", pathlib.Path(f"/proc/{self.pid}/status").read_text())[1])
 
@@ -252,18 +257,70 @@ def in_a_new_process(program=sys.executable):
 
 
 def eventually(condition, timeout=10, what="the condition"):
-    """Waits until condition() is true."""
-    end = time.monotonic() + timeout
+    """Waits until condition() is true, for so many seconds of a machine that runs: one that stands still adds little."""
+    left, looked = timeout, time.monotonic()
     while not condition():
-        if time.monotonic() > end:
+        if left < 0:
             raise AssertionError(f"{what} did not come true in {timeout} s")
         time.sleep(0.01)
+        last, looked = looked, time.monotonic()
+        left -= min(looked - last, 0.1)
+
+
+class Standstills:
+    """Watches for moments in which the machine lets nobody run, so that a limit of time can leave them out.
+
+    A thread on each processor sleeps for a moment, over and over. Where it oversleeps, the processor stood still.
+    """
+
+    MOMENT = 0.01
+    LONG = 0.05  # more than a busy machine lets somebody wait who hardly ever wants to run
+
+    def __init__(self, test):
+        self.gaps, self.ended = [], False
+        self.threads = [threading.Thread(target=self._watch, args=(cpu,), daemon=True) for cpu in os.sched_getaffinity(0)]
+        self.seen = {}  # until when each thread has looked
+        for thread in self.threads:
+            thread.start()
+        test.addCleanup(self._end)
+
+    def _end(self):
+        self.ended = True
+        for thread in self.threads:
+            thread.join()
+
+    def _watch(self, cpu):
+        with contextlib.suppress(OSError):  # a processor that has gone
+            os.sched_setaffinity(0, {cpu})
+        while not self.ended:
+            slept = time.monotonic()
+            time.sleep(self.MOMENT)
+            if (woke := time.monotonic()) - slept > self.LONG:
+                self.gaps.append((slept, woke))
+            self.seen[cpu] = woke
+
+    def between(self, start, end):
+        """Seconds between two moments of time.monotonic() in which a processor stood still."""
+        # Whoever was woken first must wait for what the others saw.
+        while len(self.seen) < len(self.threads) or min(self.seen.values()) < end:
+            time.sleep(0.001)
+        seconds, at = 0.0, start
+        for slept, woke in sorted(self.gaps):
+            seconds += max(min(woke, end) - max(slept, at), 0)
+            at = max(at, min(woke, end))
+        return seconds
+
+    def ran(self, start, end=None):
+        """Seconds from `start` to `end`, or until now, in which the machine ran."""
+        end = end or time.monotonic()
+        return end - start - self.between(start, end)
 
 
 class HelperTest(unittest.TestCase):
     """A running daemon for each test, with this Python entitled and both logs recorded."""
 
     activated = False
+    _standstills = None
 
     def setUp(self):
         self.logs = Logs()
@@ -280,6 +337,12 @@ class HelperTest(unittest.TestCase):
         client = wire.Client()
         self.addCleanup(client.close)
         return client
+
+    def watch_machine(self):
+        """From now on; the limits of time that a test sets leave its standstills out."""
+        if self._standstills is None:
+            self._standstills = Standstills(self)
+        return self._standstills
 
 
 def main():

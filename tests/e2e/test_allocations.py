@@ -651,10 +651,7 @@ class Databases(AllocationsTest):
         self.updates = UpdateTest()
         self.updates.logs = self.logs
         self.updates.prepare()
-        # Reading all of the system's authorities takes half a million blocks.
-        network.run("mount", "--bind", self.updates.authority.certificate, network.SYSTEM_AUTHORITIES)
         self.addCleanup(self.updates.doCleanups)
-        self.addCleanup(network.run, "umount", network.SYSTEM_AUTHORITIES)
 
     def state(self):
         return {path.name: path.read_bytes() for path in DIRECTORY.iterdir()}, self.updates.records()
@@ -873,8 +870,6 @@ class FirstUpdate(FirstRequest):
         updates.logs = self.logs
         updates.prepare()
         self.addCleanup(updates.doCleanups)
-        network.run("mount", "--bind", updates.authority.certificate, network.SYSTEM_AUTHORITIES)
-        self.addCleanup(network.run, "umount", network.SYSTEM_AUTHORITIES)
         version = itertools.count(1)
 
         def prepare():

@@ -19,12 +19,15 @@ class HostileClients(HelperTest):
     def setUp(self):
         super().setUp()
         self.good = self.client()
+        self.machine = self.watch_machine()
 
     def assert_served(self, within=2.0):
         """The well-behaved client beside the hostile one gets its answer."""
         started = time.monotonic()
         self.assertEqual(self.good.copy_preference("com.example.none", "key"), b"")
-        self.assertLess(time.monotonic() - started, within)
+        ended = time.monotonic()
+        if ended - started > within:
+            self.assertLess(self.machine.ran(started, ended), within)
 
     def test_messages_of_random_bytes_get_an_answer_of_the_protocol_or_silence(self):
         generator = random.Random(20260)
@@ -105,7 +108,7 @@ class HostileClients(HelperTest):
         # The first caller to exit leaves the queue behind on which exits are handled.
         self.assertEqual(as_account("root", lambda: wire.Client().close() or 0), 0)
         eventually(lambda: "global" in self.daemon.threads(), what="the exit being handled")
-        before = self.daemon.descriptors()
+        before = self.settled_descriptors()
         for what in (signal.SIGSTOP, signal.SIGKILL):
             pid = os.fork()
             if pid == 0:
@@ -159,6 +162,17 @@ class HostileClients(HelperTest):
         for pid in pids:
             self.assertEqual(os.waitstatus_to_exitcode(os.waitpid(pid, 0)[1]), 0)
 
+    def settled_descriptors(self):
+        """How many it has when it has done all that was asked of it."""
+        seen = []
+
+        def settled():
+            seen.append(self.daemon.descriptors())
+            time.sleep(0.02)
+            return len(seen) > 10 and len(set(seen[-10:])) == 1
+        eventually(settled, what="descriptors that stay")
+        return seen[-1]
+
     def test_500_clients_come_and_go_and_descriptors_and_memory_are_back(self):
         def crowd():
             clients = [wire.Client() for _ in range(500)]
@@ -168,7 +182,7 @@ class HostileClients(HelperTest):
                 client.close()
         crowd()
         eventually(lambda: self.daemon.descriptors() < 60, what="500 clients' descriptors going back")
-        before, memory = self.daemon.descriptors(), self.daemon.resident_kib()
+        before, memory = self.settled_descriptors(), self.daemon.resident_kib()
         for _ in range(2):
             crowd()
         eventually(lambda: self.daemon.descriptors() <= before, what="the descriptors going back")

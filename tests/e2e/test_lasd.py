@@ -98,6 +98,10 @@ class UpdateTest(HelperTest):
                              (contents or self.content)(name, entry["Version"]), name)
         self.assertEqual(sorted(file.name for file in DIRECTORY.iterdir()), sorted(f"{name}.db" for name in manifest))
 
+    def assert_asked(self, *paths, since=0):
+        eventually(lambda: len(self.server.requests()) >= since + len(paths), what=f"requests for {paths}")
+        self.assertEqual(self.server.requests()[since:], list(paths))
+
     def failure(self, url, error, code=0, status="no status"):
         return f"HTTP request failed for URL {url} with error {error} errorcode {code} ({status})"
 
@@ -115,7 +119,7 @@ class Updates(UpdateTest):
         self.assertEqual(self.check(count=5), available())
         self.assert_installed(manifest)
         self.assertEqual(DIRECTORY.stat().st_mode & 0o7777, 0o755)
-        self.assertEqual(self.server.requests(), ["/1/v3/lasd.plist", *(f"/content/{n}.db.gz" for n in ORDER)])
+        self.assert_asked("/1/v3/lasd.plist", *(f"/content/{n}.db.gz" for n in ORDER))
         for header in self.port.headers:
             self.assertEqual((header[0], header[2], header[3], header[4], header[5]), (0, 0, 0, 0, 0))
         self.assertIn("libcurl", self.daemon.maps())
@@ -124,7 +128,7 @@ class Updates(UpdateTest):
 
         self.assertEqual(self.check(), ["NoUpdateRequired"])
         self.logs.wait_for("unified", ERROR, "No update required for any databases")
-        self.assertEqual(self.server.requests()[6:], ["/1/v3/lasd.plist"])
+        self.assert_asked("/1/v3/lasd.plist", since=6)
 
     def test_versions_compare_by_the_table(self):
         local = {"gsm": "2.0", "umts": "ABC", "cdma": "3.1", "lte": "1.9", "scdma": "1"}
@@ -148,7 +152,7 @@ class Updates(UpdateTest):
     def test_mask_0_fetches_the_manifest_and_finds_nothing(self):
         self.serve({"gsm": "1"})
         self.assertEqual(self.check(0), ["NoUpdateRequired"])
-        self.assertEqual(self.server.requests(), ["/1/v3/lasd.plist"])
+        self.assert_asked("/1/v3/lasd.plist")
 
     def test_a_failed_database_does_not_stop_the_others(self):
         self.serve({name: "1" for name in ORDER})
@@ -316,6 +320,8 @@ class Kills(UpdateTest):
             return blob[name] + version.encode()
 
         self.serve({name: "0" for name in ORDER}, contents)
+        self.check(count=5)
+        self.serve({name: "0.1" for name in ORDER}, contents)  # the first has loaded the HTTP client
         begun = time.monotonic()
         self.check(count=5)
         whole = time.monotonic() - begun
@@ -327,7 +333,10 @@ class Kills(UpdateTest):
             self.daemon.process.kill()
             self.daemon.wait()
             self.daemon.stop()
-            interrupted += self.records() != manifest
+            if self.records() != manifest:
+                interrupted += 1
+            else:
+                whole *= 0.8  # the machine is faster now than it was
             for name, entry in self.records().items():
                 # Whatever is recorded is there whole: as recorded, or not there, or newer.
                 file = DIRECTORY / f"{name}.db"

@@ -8,7 +8,6 @@ import shutil
 import signal
 import tempfile
 import threading
-import time
 
 import wire
 from harness import ERROR, INFO, LOG_ERR, SANITIZED, Daemon, HelperTest, main
@@ -132,9 +131,9 @@ class Values(PreferencesTest):
                 + len(body).to_bytes(8, "big"))
         before = self.daemon.resident_kib()
         for value in (deep, bomb, b"bplist00" + b"\xff" * 40, binary([1, 2])[:-1]):
-            start = time.monotonic()
+            before_it = self.daemon.cpu_seconds()
             self.assertEqual(self.caller.set_preference(DOMAIN, "key", value, "memfd"), 5)
-            self.assertLess(time.monotonic() - start, 2)
+            self.assertLess(self.daemon.cpu_seconds() - before_it, 2)
         self.assertLess(self.daemon.resident_kib() - before, 32 * 1024)
         self.assertIsNone(self.copy("key"))
 
@@ -153,14 +152,15 @@ class Kills(PreferencesTest):
         answered = 0
         for round_number in range(25):
             with wire.Client() as caller:
-                # After some answers, somewhere within the sets that follow.
+                # After an answer, somewhere within the sets that follow.
                 timer = threading.Timer(0.002 + 0.0007 * round_number, os.kill, (self.daemon.pid, signal.SIGKILL))
-                timer.start()
                 try:
                     while True:
                         value = {"Number": answered + 1, "Text": "x" * ((answered * 7919) % 20_000)}
                         if caller.set_preference(DOMAIN, "key", xml(value)) == 0:
                             answered += 1
+                        if timer.ident is None:
+                            timer.start()
                 except (wire.Closed, OSError):
                     pass
                 timer.join()
@@ -172,7 +172,7 @@ class Kills(PreferencesTest):
             answered = stored["Number"]
             self.daemon.stop()
             self.daemon = Daemon()
-        self.assertGreater(answered, 5 if SANITIZED else 25)
+        self.assertGreaterEqual(answered, 25)
         with wire.Client() as caller:
             self.assertEqual(plistlib.loads(caller.copy_preference(DOMAIN, "key"))["Number"], answered)
 

@@ -5,7 +5,6 @@ import os
 import pathlib
 import plistlib
 import struct
-import time
 
 import wire
 from harness import ERROR, INFO, LOG_ERR, HelperTest, eventually, main
@@ -226,9 +225,9 @@ class Bombs(HelperTest):
         bomb = body + bytes(offsets) + bytes(6) + struct.pack(">BBQQQ", 1, 1, 8, 0, len(body))
         deep = binary_nesting(depth)
         for bad, way in ((xml, "memfd"), (deep, "memfd"), (bomb, "in line")):
-            started = time.monotonic()
+            before_it = self.daemon.cpu_seconds()
             self.assertEqual(client.set_preference(DOMAIN, "bomb", bad, way), 5)
-            self.assertLess(time.monotonic() - started, 2)
+            self.assertLess(self.daemon.cpu_seconds() - before_it, 2)
         self.assertEqual(client.copy_preference(DOMAIN, "bomb"), b"")
         self.assertLess(self.daemon.resident_kib() - before, 64 * 1024)
 

@@ -11,7 +11,7 @@ import sys
 import time
 
 import wire
-from harness import (ALLOW, BUILD, ENTITLEMENTS, ERROR, LOG_ERR, Daemon, HelperTest, as_account, entitle,
+from harness import (ALLOW, BUILD, ENTITLEMENTS, ERROR, LOG_ERR, Daemon, HelperTest, as_account, entitle, eventually,
                      in_a_new_process, main, refused_with)
 
 SYSTEM_BUS = pathlib.Path("/run/dbus/system_bus_socket")
@@ -117,7 +117,8 @@ class EntitlementFiles(HelperTest):
         for _ in range(20):
             self.assertEqual(refused_with(), 35)
         self.assertEqual(as_account("stranger", refused_with), 35)
-        self.assertLessEqual(self.daemon.descriptors(), before)
+        # It learns a little later that a caller has closed its connection.
+        eventually(lambda: self.daemon.descriptors() <= before, what="every descriptor being closed")
 
 
 class RadioLogs(HelperTest):
@@ -139,24 +140,27 @@ class RadioLogs(HelperTest):
         bus.bind(str(SYSTEM_BUS))
         bus.listen(8)
         bus.settimeout(10)
+        machine = self.watch_machine()
         client = self.client()
         self.enable(client, 1)
         connection, _ = bus.accept()
-        start = time.monotonic()
+        moments = [time.monotonic()]
         for _ in range(50):
             self.enable(client, 1)
-        self.assertLess(time.monotonic() - start, 0.9)
+            moments.append(time.monotonic())
+        self.assertLess(max(map(machine.ran, moments, moments[1:])), 0.5)
         with connection:
             connection.settimeout(10)
             self.assertTrue(connection.recv(100).startswith(b"\0AUTH EXTERNAL"))
             while connection.recv(4096):  # until it is given up
                 pass
-        self.assertLess(time.monotonic() - start, 3)
-        second, _ = bus.accept()  # the switches that came meanwhile are one
-        second.close()
+        self.assertLess(machine.ran(moments[0]), 3)
+        # The switches that came meanwhile are one. A machine that let us send for longer has seen more of these waits.
+        bus.accept()[0].close()
         bus.settimeout(1.5)
         with self.assertRaises(TimeoutError):
-            bus.accept()
+            for _ in range(1 + int((moments[-1] - moments[0]) / 0.9)):
+                bus.accept()[0].close()
 
 
 class HostedBaseband(HelperTest):
@@ -177,10 +181,12 @@ class HostedBaseband(HelperTest):
         self.host()
         self.assertEqual(self.calls.read_text(), "?cs")
         self.busy.touch()
+        closed = time.monotonic()
         self.client().close()
-        time.sleep(TICK + 2)
+        eventually(lambda: self.calls.read_text() == "?csb", TICK + 5, "the first tick's question")
+        self.assertGreaterEqual(time.monotonic() - closed, TICK - 0.1)
+        time.sleep(1)
         self.assertTrue(self.daemon.running())
-        self.assertEqual(self.calls.read_text(), "?csb")
         self.busy.unlink()
         self.assertEqual(self.daemon.wait(), 0)
         self.assertEqual(self.calls.read_text(), "?csbbxr")
