@@ -25,6 +25,7 @@ class Allocations:
         path.write_bytes(bytes(FORMAT.size))
         with open(path, "r+b") as file:
             self._map = mmap.mmap(file.fileno(), FORMAT.size)
+        self._names = {}  # (file, offset): its function and line
         self.environment = {"LD_PRELOAD": str(LIBRARY), "BRENVIK_ALLOCATIONS": str(path)}
 
     def close(self):
@@ -75,9 +76,11 @@ class Allocations:
                 start, end, offset = (int(found[i], 16) for i in (1, 2, 3))
                 places.update((address, (found[4], address - start + offset - 1))
                               for address in fields[7:7 + fields[6]] if start <= address < end)
-        names = {}
+        names = self._names
         for file in {file for file, _ in places.values()}:
-            offsets = [offset for other, offset in places.values() if other == file]
+            offsets = [offset for other, offset in places.values() if other == file and (file, offset) not in names]
+            if not offsets:
+                continue
             lines = subprocess.run(["addr2line", "-Cfse", file, *map(hex, offsets)], capture_output=True, text=True,
                                    check=False).stdout.splitlines()
             names.update(((file, offset), (lines[2 * i], lines[2 * i + 1].split(" ")[0]))

@@ -109,8 +109,10 @@ def os_setns(descriptor):
         raise OSError(ctypes.get_errno(), "setns")
 
 
-def on_monotonic_clock(seconds, nanoseconds):
-    """What time.monotonic() said when the clock of the day said this."""
+def arrival(ancillary):
+    """When the kernel had a packet that came to a socket with SO_TIMESTAMPNS, on the clock of time.monotonic."""
+    seconds, nanoseconds = next(struct.unpack("=qq", value) for _, kind, value in ancillary if kind == SO_TIMESTAMPNS)
+
     def look():
         before, day, after = time.monotonic(), time.time(), time.monotonic()
         return after - before, day - before
@@ -134,10 +136,9 @@ class Tap:
             if not select.select([self.sock], [], [], left)[0]:
                 return result
             data, ancillary, _, (_, protocol, kind, *_) = self.sock.recvmsg(65536, 128)
-            at = next(struct.unpack("=qq", value) for _, number, value in ancillary if number == SO_TIMESTAMPNS)
             housekeeping = protocol == ETH_P_IPV6 and data[6] in (0, 58)
             if kind != socket.PACKET_OUTGOING and not housekeeping:
-                result.append((on_monotonic_clock(*at), protocol, data))
+                result.append((arrival(ancillary), protocol, data))
 
     def close(self):
         self.sock.close()

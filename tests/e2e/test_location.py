@@ -133,11 +133,12 @@ class LocationTest(HelperTest):
 
     def check_others_are_served(self, client):
         """While something waits for a second or more: other requests take milliseconds."""
-        times = []
+        machine = self.watch_machine()
+        moments = [time.monotonic()]
         for _ in range(11):
-            start = time.monotonic()
             client.text("CopyCountryCode", size=64)
-            times.append(time.monotonic() - start)
+            moments.append(time.monotonic())
+        times = list(map(machine.ran, moments, moments[1:]))
         # Room for a busy machine, but none for a wait.
         self.assertLess(sorted(times)[5], 0.05)
         self.assertLess(max(times), 0.5)
@@ -292,12 +293,13 @@ class BrenvikTest(LocationTest):
 
     def test_the_stand_in_prints_what_it_is_told(self):
         standin = subprocess.Popen(
-            [harness.BUILD / "brenvik-standin", "--json", "--count", "1"], stdout=subprocess.PIPE, text=True)
+            [harness.BUILD / "brenvik-standin", "--json", "--count", "1"], stdout=subprocess.PIPE,
+            stderr=subprocess.PIPE, text=True)
         self.addCleanup(standin.wait)
         self.addCleanup(standin.kill)
         self.addCleanup(standin.stdout.close)
-        path = pathlib.Path(wire.BOOTSTRAP) / "com.norvale.brenvik"
-        eventually(path.exists, what="the stand-in's socket")
+        self.addCleanup(standin.stderr.close)
+        self.assertIn("listening in", standin.stderr.readline())
         self.ask_civic(self.client(), 59.9133, 10.739)
         self.lines(CIVIC_SENT)
         told = json.loads(standin.stdout.readline())
@@ -318,8 +320,9 @@ class WanIpTest(LocationTest):
             stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
         self.addCleanup(server.wait)
         self.addCleanup(server.kill)
-        bound = lambda: int(subprocess.run(far.command("ss", "-Hlun", "sport", "=", "3478"), capture_output=True,
-                                           text=True, check=True).stdout.count("3478")) >= len(theirs)
+        def bound():
+            sockets = network.run(*far.command("ss", "-Hlun", "sport", "=", "3478")).stdout
+            return all(f"{each.split('/')[0]}" in sockets for each in theirs)
         eventually(bound, 20, "coturn")
 
     def test_ipv4(self):
@@ -350,16 +353,18 @@ class WanIpTest(LocationTest):
     def test_nobody_listening_is_an_error_at_once(self):
         self.resolve(f"127.0.0.1 {STUN}")
         brenvik = Brenvik(self)
+        machine = self.watch_machine()
         start = time.monotonic()
         self.ask_wan_ip(self.client())
         self.assertEqual(brenvik.wait_for(1), [address("")])
-        self.assertLess(time.monotonic() - start, 4)
+        self.assertLess(machine.ran(start), 4)
         self.lines(("unified", ERROR, "_RequestWanIPFromLocation error: (the STUN server cannot be reached)"),
                    WAN_IP_SENT)
 
     def stun_server(self, answer):
         """A server of our own on this machine; answer(request, sender) gives the datagrams it sends."""
         server = socket.socket(socket.AF_INET, socket.SOCK_DGRAM)
+        server.setsockopt(socket.SOL_SOCKET, network.SO_TIMESTAMPNS, 1)
         server.bind(("127.0.0.1", 3478))
         self.resolve(f"127.0.0.1 {STUN}")
         requests = []
@@ -367,12 +372,12 @@ class WanIpTest(LocationTest):
         def serve():
             while True:
                 try:
-                    request, sender = server.recvfrom(2048)
+                    request, ancillary, _, sender = server.recvmsg(2048, 128)
                 except OSError:
                     return
                 if request == b"end":
                     return
-                requests.append((time.monotonic(), request))
+                requests.append((network.arrival(ancillary), request))
                 for datagram in answer(request, sender):
                     server.sendto(datagram, sender)
 
@@ -391,6 +396,7 @@ class WanIpTest(LocationTest):
     def test_no_answer_within_five_seconds_is_an_empty_address_and_the_late_error_is_dropped(self):
         requests = self.stun_server(lambda request, sender: [])
         brenvik = Brenvik(self)
+        machine = self.watch_machine()
         start = time.monotonic()
         self.ask_wan_ip(self.client())
         self.assertEqual(brenvik.wait_for(1), [address("")])
@@ -398,11 +404,14 @@ class WanIpTest(LocationTest):
         self.lines(WAN_IP_SENT, WAN_IP_NOT_AWAITED)
         self.assertEqual(len(brenvik.pushes), 1)
         # The same question five times, at 0, 0.25, 0.75, 1.75 and 3.75 s.
-        self.assertEqual(len(requests), 5)
         self.assertEqual(len({request for _, request in requests}), 1)
+        self.assertLessEqual(len(requests), 5)
+        if requests[0][0] - start > 0.2 or machine.between(start, start + 5) > 0.2:
+            return  # those that fall due while the machine stands still are one
+        self.assertEqual(len(requests), 5)
         for (at, _), due in zip(requests, (0, 0.25, 0.75, 1.75, 3.75)):
-            self.assertGreaterEqual(at - requests[0][0], due - 0.05)
-            self.assertLess(at - requests[0][0], due + 1)
+            self.assertGreaterEqual(at - start, due - 0.05)
+            self.assertLess(at - start, due + 1)
 
     @staticmethod
     def seen_as(text, request, identity=None):
@@ -632,11 +641,12 @@ class GeocoderTest(LocationTest):
 
         self.map.answer = note
         client = self.client()
+        asked = time.monotonic()
         for _ in range(3):
             self.ask_civic(client, 48.8584, 2.2945)
-        eventually(lambda: len(times) == 3, what="three requests")
-        # Two seconds between the first and the third, less what the first connection took longer.
-        self.assertGreater(times[2] - times[0], 1)
+        eventually(lambda: len(times) == 3, 30, "three requests")
+        # The first may be late, for it takes a connection; the third comes two seconds after it was due.
+        self.assertGreater(times[2] - asked, 1.9)
 
     def test_a_certificate_nobody_trusts_is_answered_offline(self):
         self.map._end()

@@ -59,6 +59,35 @@ def wait_for(condition, what, seconds=20):
         time.sleep(0.05)
 
 
+class Standstills:
+    """Watches for moments in which the machine lets nobody run: a thread sleeps for a moment, over and over, and tells
+    what it oversleeps."""
+
+    def __enter__(self):
+        self.gaps, self.seen, self.ended = [], 0.0, False
+        self.thread = threading.Thread(target=self._watch)
+        self.thread.start()
+        return self
+
+    def __exit__(self, *_):
+        self.ended = True
+        self.thread.join()
+
+    def _watch(self):
+        while not self.ended:
+            slept = time.monotonic()
+            time.sleep(0.01)
+            if (woke := time.monotonic()) - slept > 0.05:
+                self.gaps.append((slept, woke))
+            self.seen = woke
+
+    def between(self, start, end):
+        """Seconds between two moments of time.monotonic() in which it stood still."""
+        while self.seen < end:
+            time.sleep(0.001)
+        return sum(max(min(woke, end) - max(slept, start), 0) for slept, woke in self.gaps)
+
+
 def log_of_the_helper():
     return run("journalctl", "-t", "BrenvikMobileHelper", "-o", "cat").stdout
 
@@ -405,26 +434,36 @@ def beats_over_the_cellular_link():
     def waiting():
         return len(pathlib.Path("/proc/net/icmp").read_text().splitlines()) - 1
 
-    with Tunnel("pdp_ip0", "10.5.0.1") as cellular, Tunnel("wifi0", "192.0.2.2") as other:
+    with Tunnel("pdp_ip0", "10.5.0.1") as cellular, Tunnel("wifi0", "192.0.2.2") as other, Standstills() as machine:
         bvhelperctl("heartbeat", "on")
         identifier = int(property_of(SERVICE, "MainPID")) & 0xFFFF
         arrivals = []
         for number in range(4):  # of the start, of the timer's first firing, and of two more
+            waited_from = time.monotonic()
             requests = cellular.echo_requests(1, 10)
-            expect_equal(len(requests), 1, "echo requests that arrive at the far end")
-            request = requests[0]
             arrivals.append(time.monotonic())
+            # A machine that stands still lets a wait run out, and what comes of it is no more than late.
+            stood = machine.between(waited_from, arrivals[-1]) > 0
+            expect(len(requests) == 1 or stood and requests, f"{len(requests)} echo requests arrive at the far end")
+            request = requests[-1]
             expect_equal((socket.inet_ntoa(request[16:20]), len(request)), ("192.0.2.1", 20 + 48), "the request")
             expect_equal(struct.unpack_from("!HH", request, 24), (identifier, 0), "identifier and sequence number")
-            expect_equal(waiting(), 1, "sockets that wait for a reply")
+            expect(waiting() == 1 or stood, f"{waiting()} sockets wait for a reply")
             cellular.answer(request)
             if number > 0:
-                wait_for(lambda: waiting() == 0, "the reply ends the wait", 0.5)
+                answered = time.monotonic()
+                wait_for(lambda: waiting() == 0, "the reply ends the wait")
+                ended = time.monotonic()
+                took = ended - answered - machine.between(answered, ended)
+                expect(took < 0.5, f"the reply ends the wait after {took:.2f} s")
         # The second waits for the reply to the first, which would be a second's wait without one.
-        expect(arrivals[1] - arrivals[0] < 0.5, f"the second request after {arrivals[1] - arrivals[0]:.2f} s")
+        apart = arrivals[1] - arrivals[0] - machine.between(*arrivals[:2])
+        expect(apart < 0.5, f"the second request after {apart:.2f} s")
         for earlier, later in zip(arrivals[1:], arrivals[2:]):
-            expect(1.5 < later - earlier < 2.5, f"requests {later - earlier:.2f} s apart")
+            room = 0.5 + machine.between(earlier - 2, later)  # after a late one, the next comes the sooner
+            expect(abs(later - earlier - 2) < room, f"requests {later - earlier:.2f} s apart")
         bvhelperctl("heartbeat", "off")
+        wait_for(lambda: waiting() == 0, "the end of the last request")
         time.sleep(0.2)
         cellular.echo_requests()
         time.sleep(2.5)
@@ -519,7 +558,8 @@ def a_burst_is_one_start():
 
 def nothing_is_lost_at_the_idle_edge():
     """1,000 requests around 50 idle edges: as many instances of the unit, each asked twenty times around the moment in
-    which it leaves. The first of the twenty comes between 5 ms before that moment and 35 ms after it."""
+    which it leaves. The first of the twenty comes between 5 ms before that moment and 35 ms after it; later where the
+    machine is so busy that others have been there still."""
     instances, each_time = 50, 20
     unit = pathlib.Path(f"/lib/systemd/system/{SERVICE}").read_text().replace(SOCKET, "edge@%i.socket")
     pathlib.Path("/run/systemd/system/edge@.service").write_text(unit)
@@ -530,18 +570,24 @@ def nothing_is_lost_at_the_idle_edge():
     run("systemctl", "start", *names)
     library = Library()
     answers = [[] for _ in range(instances)]
+    busy = 0.0  # how much later processes leave than on an idle machine
     began = time.monotonic() + 0.5
     spacing = 0.2  # starts spread over ten seconds, so that the processors are not what is measured
 
     def client(number):
+        nonlocal busy
         path = f"/run/edge/{number}"
         time.sleep(max(0.0, began + number * spacing - time.monotonic()))
         expect_equal(library.request(path), (0, "a-token"), f"first request of {number}")
         edge = time.monotonic() + IDLE
-        first = -0.005 + 0.040 * (number * 37 % instances) / instances
+        before = property_of(f"edge@{number}.service", "MainPID")
+        time.sleep(max(0.0, edge - 0.1 - time.monotonic()))
+        first = busy - 0.005 + 0.040 * (number * 37 % instances) / instances
         for turn in range(each_time):
             time.sleep(max(0.0, edge + first + turn * 0.004 - time.monotonic()))
             answers[number].append(library.request(path))
+        met = property_of(f"edge@{number}.service", "MainPID") != before
+        busy = max(0.0, busy + (-0.005 if met else 0.02))
 
     threads = [threading.Thread(target=client, args=(number,)) for number in range(instances)]
     for thread in threads:
@@ -558,6 +604,9 @@ def nothing_is_lost_at_the_idle_edge():
     run("systemctl", "stop", *names)
 
 
+LIMIT_SEEN = pathlib.Path("/run/brenvik-test-limit-seen")
+
+
 def hit_a_limit(result, **settings):
     """With a helper that dies of every client, and these settings for the units, until one of their limits is hit."""
     files = []
@@ -565,6 +614,7 @@ def hit_a_limit(result, **settings):
         files.append(pathlib.Path(f"/run/systemd/system/brenvik-mobile-helper.{unit}.d/broken.conf"))
         files[-1].parent.mkdir(parents=True, exist_ok=True)
         files[-1].write_text(text + settings[unit])
+    LIMIT_SEEN.unlink(missing_ok=True)
     run("systemctl", "stop", SERVICE)
     run("systemctl", "daemon-reload")
     bvhelperctl("--timeout", "5", "ping", check=False)
@@ -573,19 +623,21 @@ def hit_a_limit(result, **settings):
     for file in files:
         file.unlink()
     run("systemctl", "daemon-reload")
+    LIMIT_SEEN.touch()
     wait_for(lambda: property_of(SOCKET, "ActiveState") == "active", "the way back", 30)
     bvhelperctl("ping")
 
 
 def comes_back_after_a_limit():
     hit_a_limit("service-start-limit-hit", service="[Unit]\nStartLimitBurst=5\n", socket="")
-    # The same way back, so it need not be waited for as long.
+    # The same way back, which need not be waited for: it is open when the limit has been seen.
     folder = pathlib.Path("/run/systemd/system/brenvik-mobile-helper-restore.service.d")
     folder.mkdir()
-    (folder / "sooner.conf").write_text("[Service]\nExecStart=\nExecStart=/bin/sleep 2\n" + "".join(
+    wait = f"/bin/sh -c 'until [ -e {LIMIT_SEEN} ]; do sleep 0.1; done'"
+    (folder / "sooner.conf").write_text(f"[Service]\nExecStart=\nExecStart={wait}\n" + "".join(
         line + "\n" for line in pathlib.Path("/lib/systemd/system/brenvik-mobile-helper-restore.service").read_text().splitlines()
         if line.startswith("ExecStart=/bin/systemctl")))
-    hit_a_limit("trigger-limit-hit", service="[Unit]\nStartLimitBurst=1000\n", socket="[Socket]\nTriggerLimitBurst=5\n")
+    hit_a_limit("trigger-limit-hit", service="[Unit]\nStartLimitBurst=1000\n", socket="[Socket]\nTriggerLimitIntervalSec=60s\nTriggerLimitBurst=5\n")
 
 
 def upgrade():
@@ -606,7 +658,11 @@ def remove():
     run("dpkg", "-r", "brenvik-mobile-helper")
     expect(not os.path.exists(PATH), "nobody listens")
     expect(not os.path.exists("/usr/libexec/brenvik"), "the programs are gone")
-    running = [each for each in glob.glob("/proc/[0-9]*/comm") if pathlib.Path(each).read_text() == "BrenvikMobileHe\n"]
+    running = []
+    for each in glob.glob("/proc/[0-9]*/comm"):
+        with contextlib.suppress(FileNotFoundError, ProcessLookupError):  # a process that has ended since it was listed
+            if pathlib.Path(each).read_text() == "BrenvikMobileHe\n":
+                running.append(each)
     expect_equal(running, [], "none is left running")
     expect_equal(bvhelperctl("ping", check=False).returncode, 2, "no helper")
     expect(os.path.exists("/etc/brenvik/entitlements.d/50-bvhelperctl.plist"), "entitlements stay")

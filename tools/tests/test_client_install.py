@@ -8,6 +8,7 @@ BRENVIK_BUILD names the build folder, BRENVIK_SOURCE the project's.
 import os
 import pathlib
 import re
+import shlex
 import subprocess
 import tempfile
 import unittest
@@ -38,7 +39,7 @@ class InstalledClient(unittest.TestCase):
 
     def config(self, *arguments):
         environment = {**os.environ, "PKG_CONFIG_PATH": str(self.library.parent / "pkgconfig")}
-        return run("pkg-config", *arguments, "brenvik-mobile-helper", env=environment).split()
+        return shlex.split(run("pkg-config", *arguments, "brenvik-mobile-helper", env=environment))
 
     def expect_working(self, program):
         path = self.folder / "helper"
