@@ -11,6 +11,7 @@ import pathlib
 import plistlib
 import pwd
 import re
+import resource
 import select
 import socket
 import struct
@@ -274,11 +275,13 @@ class Standstills:
     """
 
     MOMENT = 0.01
+    MOST = 8  # processors of a large machine
     LONG = 0.05  # more than a busy machine lets somebody wait who hardly ever wants to run
 
     def __init__(self, test):
         self.gaps, self.ended = [], False
-        self.threads = [threading.Thread(target=self._watch, args=(cpu,), daemon=True) for cpu in os.sched_getaffinity(0)]
+        self.threads = [threading.Thread(target=self._watch, args=(cpu,), daemon=True)
+                        for cpu in sorted(os.sched_getaffinity(0))[:self.MOST]]
         self.seen = {}  # until when each thread has looked
         for thread in self.threads:
             thread.start()
@@ -298,6 +301,11 @@ class Standstills:
             if (woke := time.monotonic()) - slept > self.LONG:
                 self.gaps.append((slept, woke))
             self.seen[cpu] = woke
+
+    def count(self, start, end):
+        """How often a processor stood still between two moments of time.monotonic()."""
+        self.between(start, end)
+        return sum(slept < end and woke > start for slept, woke in self.gaps)
 
     def between(self, start, end):
         """Seconds between two moments of time.monotonic() in which a processor stood still."""
@@ -337,6 +345,12 @@ class HelperTest(unittest.TestCase):
         client = wire.Client()
         self.addCleanup(client.close)
         return client
+
+    def need_descriptors(self, count):
+        """Skips the test where processes may not have so many."""
+        most = resource.getrlimit(resource.RLIMIT_NOFILE)[1]
+        if most != resource.RLIM_INFINITY and most < count:
+            self.skipTest(f"a process may have {most} descriptors here")
 
     def watch_machine(self):
         """From now on; the limits of time that a test sets leave its standstills out."""

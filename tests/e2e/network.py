@@ -33,6 +33,11 @@ def default_settings():
     ip("link", "set", "lo", "up")
 
 
+def has_ipv6():
+    setting = pathlib.Path("/proc/sys/net/ipv6/conf/default/disable_ipv6")
+    return setting.exists() and setting.read_text().strip() == "0"
+
+
 class FarEnd:
     """Another machine: a network namespace joined to ours by one interface of the given name."""
 

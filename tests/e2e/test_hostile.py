@@ -174,6 +174,8 @@ class HostileClients(HelperTest):
         return seen[-1]
 
     def test_500_clients_come_and_go_and_descriptors_and_memory_are_back(self):
+        self.need_descriptors(2048)
+
         def crowd():
             clients = [wire.Client() for _ in range(500)]
             for client in clients:

@@ -333,6 +333,7 @@ class WanIpTest(LocationTest):
         self.assertEqual(brenvik.wait_for(1), [address("198.51.100.7")])
         self.lines(WAN_IP_ASKED, ("unified", DEFAULT, "_RequestWanIPFromLocation WAN IP: 198.51.100.7"), WAN_IP_SENT)
 
+    @unittest.skipUnless(network.has_ipv6(), "this machine has no IPv6")
     def test_ipv6(self):
         self.coturn(["198.51.100.7/24", "2001:db8::7/64"], ["198.51.100.1/24", "2001:db8::1/64"])
         self.resolve(f"2001:db8::1 {STUN}")

@@ -32,7 +32,7 @@ SECONDS = float(os.environ.get("BRENVIK_SIEGE_SECONDS", 15))
 SEED = int(os.environ.get("BRENVIK_SIEGE_SEED", random.SystemRandom().randrange(1 << 32)))
 OPTIMISED = "CMAKE_BUILD_TYPE:STRING=Release" in (BUILD / "CMakeCache.txt").read_text(encoding="utf-8")
 LONGEST_WAIT = 0.1 if OPTIMISED else 1.0  # seconds
-STANDSTILL = 0.05  # seconds that a processor gives to nobody, and more
+STANDSTILL = 0.025  # seconds that a processor gives to nobody, and more
 PATIENCE = 2.0 if SANITIZED else 0.2  # of besiegers with a daemon that does not take what they send
 
 PLACES = ["/etc/passwd", "/dev/zero", "/dev/full", "/proc/kmsg", "/proc/self/mem", "/tmp/siege/fifo", "/tmp/siege/loop",
@@ -355,6 +355,7 @@ def behave_well(end, say):
 
 class Siege(HelperTest):
     def prepare(self):
+        self.need_descriptors(8192)
         entitle("51-mobile.plist", user="mobile")
         make_places()
         resource.setrlimit(resource.RLIMIT_NOFILE, (8192, 8192))
