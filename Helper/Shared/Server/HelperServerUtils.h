@@ -86,6 +86,7 @@ class ServerContext {
   std::shared_ptr<RoutineSource> serviceSource;
   RunLoop* runLoop = nullptr;  // recorded by RunServer
   const RoutineTable& clientSubsystem;
+  std::function<bool()> idleCheck;
 
   struct Client {
     std::shared_ptr<DeathWatch> deathWatch;
@@ -98,7 +99,6 @@ class ServerContext {
   std::map<PortName, std::shared_ptr<RoutineSource>> clientSources;
   std::uint32_t busyMask = 0;
   bool stopFlag = false;
-  std::function<bool()> idleCheck;  // main thread only
 };
 
 }  // namespace brenvik

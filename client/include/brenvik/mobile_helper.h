@@ -162,8 +162,11 @@ BVMH_API BVMH_CHECKED int32_t BVMobileHelperIsVoicemailServiceSubscribed(bvmh_cl
 
 /* Preferences of the helper's own account, any host. Domain and key: at most 255 bytes. */
 
-/* Stores a value: a property list, XML or binary, of any size up to 4 GiB. A value of exactly one byte,
- * whatever the byte, removes the key. BVMH_FAILURE: the bytes are no property list; nothing was changed. */
+/* Stores a value: a property list, XML or binary, of at most 511 levels and, as XML, 64 MiB. A value of
+ * exactly one byte, whatever the byte, removes the key. BVMH_FAILURE: the bytes are no property list, or too
+ * large a one; nothing was changed. BVMH_OK is the answer, too, when the value is too deep, the disk did not
+ * take it, or the domain names no file (it is empty, "." or "..", or holds a slash): the helper's log says so
+ * then. */
 BVMH_API BVMH_CHECKED int32_t BVMobileHelperSetPreferenceValue(bvmh_client* client, const char* domain,
                                                                const char* key, const void* value,
                                                                size_t length);

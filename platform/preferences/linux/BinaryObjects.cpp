@@ -32,7 +32,7 @@ Extent extentOf(const Shape& shape) noexcept {
       return {kXmlOverhead + kXmlPerCharacter * std::uint64_t{shape.count}, 1, 0};
     case kArray:
     case kDictionary:
-      return {kXmlOverhead, 2, shape.count == 0 ? 0u : 1u};
+      return {kXmlOverhead, 2, 1};  // an empty one is a level to every reader, too
     default:
       return {kXmlOverhead, 1, 0};
   }

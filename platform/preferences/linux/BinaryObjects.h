@@ -67,7 +67,7 @@ class Document {
 struct Extent {
   std::uint64_t bytes = 0;  // at the outermost level
   std::uint64_t lines = 0;  // each grows by a byte for each level around it
-  std::uint32_t depth = 0;  // levels of containers that hold something
+  std::uint32_t depth = 0;  // levels of containers, empty ones included
 };
 
 // Takes values out of a document, one at a time: each with everything it refers to, in the order in which it

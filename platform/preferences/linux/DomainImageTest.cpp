@@ -174,6 +174,18 @@ TEST(DomainImageTest, AValueIsRefusedThatWouldMakeTheDomainUnreadable) {
             PropertyList::dictionary({{"stays", PropertyList::string("here")}, {"deep", deep}}));
 }
 
+TEST(DomainImageTest, AnEmptyContainerIsALevelToo) {
+  for (const PropertyList& empty : {PropertyList::array({}), PropertyList::dictionary({})}) {
+    DomainImage image;
+    PropertyList deep = empty;
+    for (std::size_t i = 1; i < kDeepestPropertyList - 1; ++i) deep = PropertyList::array({deep});
+    EXPECT_EQ(image.set("deep", deep), DomainImage::Change::made);
+    EXPECT_TRUE(written(image)) << "just as deep as can be read";
+    EXPECT_EQ(image.set("deeper", PropertyList::array({deep})), DomainImage::Change::refused);
+    EXPECT_TRUE(written(image)) << "still";
+  }
+}
+
 TEST(DomainImageTest, EntriesThatAreLegalAloneAreRefusedWhenTheirXmlFormTogetherPassesTheLimit) {
   // More than ten MiB as XML, some hundred bytes here.
   PropertyList expanding = PropertyList::array({PropertyList::boolean(true)});

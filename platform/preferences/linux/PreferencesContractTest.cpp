@@ -171,6 +171,28 @@ TYPED_TEST(PreferencesContractTest, AValueTooDeepToBeReadBackIsNotStored) {
   EXPECT_EQ(this->get(*this->ours, "deeper"), "(none)");
 }
 
+// The innermost level of a deep value may be empty, and counts all the same.
+TYPED_TEST(PreferencesContractTest, AValueTooDeepForItsEmptyContainersIsNotStoredEither) {
+  const auto nested = [](PropertyList innermost, std::size_t levels) {
+    for (std::size_t i = 1; i < levels; ++i) innermost = PropertyList::array({innermost});
+    return innermost;
+  };
+  this->set(*this->ours, "other", "stays");
+  for (const PropertyList& empty : {PropertyList::array({}), PropertyList::dictionary({})}) {
+    this->log.clear();
+    this->ours->setValue("deep", nested(empty, 511), this->kDomain, this->kUser, this->kHost);
+    EXPECT_TRUE(this->sync(*this->ours));
+    this->ours->setValue("deeper", nested(empty, 512), this->kDomain, this->kUser, this->kHost);
+    EXPECT_FALSE(this->sync(*this->ours));
+    EXPECT_EQ(this->log.entries().size(), 1u);
+
+    EXPECT_TRUE(this->sync(*this->other));
+    EXPECT_EQ(this->get(*this->other, "other"), "stays") << "the domain can still be read";
+    EXPECT_EQ(this->other->copyValue("deep", this->kDomain, this->kUser, this->kHost), nested(empty, 511));
+    EXPECT_EQ(this->get(*this->ours, "deeper"), "(none)");
+  }
+}
+
 TYPED_TEST(PreferencesContractTest, ScopesAndDomainsAreApart) {
   const PreferencesScope scopes[] = {{UserScope::currentUser, HostScope::anyHost},
                                      {UserScope::currentUser, HostScope::currentHost},
