@@ -3,6 +3,7 @@
 #include "platform/sqlite/Sqlite.h"
 
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <fstream>
 #include <string>
@@ -10,18 +11,24 @@
 namespace brenvik {
 namespace {
 
-// First of all: nothing but the first call may load the library.
-TEST(SqliteTest, TheLibraryIsNotLoadedBeforeItsFirstUse) {
-  const auto isMapped = [] {
-    std::ifstream maps("/proc/self/maps");
-    for (std::string line; std::getline(maps, line);) {
-      if (line.find("libsqlite3") != std::string::npos) return true;
-    }
-    return false;
-  };
-  EXPECT_FALSE(isMapped());
-  ASSERT_NE(sqlite(), nullptr);
-  EXPECT_TRUE(isMapped());
+bool isMapped() {
+  std::ifstream maps("/proc/self/maps");
+  for (std::string line; std::getline(maps, line);) {
+    if (line.find("libsqlite3") != std::string::npos) return true;
+  }
+  return false;
+}
+
+// Exits with 7 when nothing but the first call loads the library.
+[[noreturn]] void loadTheLibrary() {
+  if (isMapped()) ::_exit(1);
+  if (sqlite() == nullptr) ::_exit(2);
+  ::_exit(isMapped() ? 7 : 3);
+}
+
+TEST(SqliteDeathTest, TheLibraryIsNotLoadedBeforeItsFirstUse) {
+  testing::FLAGS_gtest_death_test_style = "threadsafe";  // a process of its own, which has not loaded it yet
+  EXPECT_EXIT(loadTheLibrary(), testing::ExitedWithCode(7), "");
 }
 
 TEST(SqliteTest, EveryFunctionIsThereAndTheFirstOnesWork) {
