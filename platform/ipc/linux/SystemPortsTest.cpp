@@ -9,21 +9,21 @@
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <array>
-#include <atomic>
 #include <chrono>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <iostream>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "platform/ipc/linux/MessageTrailerBuilder.h"
@@ -36,6 +36,19 @@ namespace brenvik {
 namespace {
 
 using namespace std::chrono_literals;
+
+std::function<void()> beforeLocking;  // what happens before a file is locked
+
+}  // namespace
+}  // namespace brenvik
+
+extern "C" int flock(int fd, int operation) noexcept {
+  if (brenvik::beforeLocking != nullptr) brenvik::beforeLocking();
+  return static_cast<int>(::syscall(SYS_flock, fd, operation));
+}
+
+namespace brenvik {
+namespace {
 
 std::size_t openDescriptors() {
   std::size_t count = 0;
@@ -803,15 +816,13 @@ TEST_F(ServiceTest, ANameThatALiveProcessHoldsIsRefusedAndSaidWhy) {
 TEST_F(ServiceTest, WhoeverStartsAtTheSameTimeWaitsForTheOtherToBeDone) {
   const UniqueFd lock(::open((directory + "/.service.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
   ASSERT_EQ(::flock(lock.get(), LOCK_EX), 0);
-  std::atomic<bool> isDone = false;
-  std::thread other([&] {
-    std::this_thread::sleep_for(30ms);
-    isDone = true;
-    ::flock(lock.get(), LOCK_UN);
-  });
+  int tries = 0;
+  beforeLocking = [&] {
+    if (++tries == 3) ::syscall(SYS_flock, lock.get(), LOCK_UN);  // the other is done
+  };
   listen();
-  EXPECT_TRUE(isDone);
-  other.join();
+  beforeLocking = nullptr;
+  EXPECT_EQ(tries, 3);
   EXPECT_TRUE(connect().isValid());
 }
 
