@@ -137,7 +137,12 @@ TEST(PreferencesCrashTest, WritersKilledAtAnyMomentLoseNothingAnsweredAndTearNot
   int killedWithinAWrite = 0;
   killWriters(kKillsOnDisk, TestHome(), killedWithinAWrite);
   const bool hasMemoryFolder = ::access("/dev/shm", W_OK) == 0;
-  killWriters(kKills - kKillsOnDisk, hasMemoryFolder ? TestHome("/dev/shm") : TestHome(), killedWithinAWrite);
+  // Where a sanitizer or other work makes writers slow few kills hit; when none has, more are needed.
+  for (int round = 0; round == 0 || (killedWithinAWrite == 0 && round < 10); ++round) {
+    killWriters(kKills - kKillsOnDisk, hasMemoryFolder ? TestHome("/dev/shm") : TestHome(),
+                killedWithinAWrite);
+    if (HasFatalFailure()) return;
+  }
   EXPECT_GT(killedWithinAWrite, 0) << "no kill ever hit a write: this has tested nothing";
   RecordProperty("killedWithinAWrite", killedWithinAWrite);
 }
