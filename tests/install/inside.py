@@ -127,6 +127,17 @@ class Library:
         finally:
             self.lib.bvmh_client_free(client)
 
+    @contextlib.contextmanager
+    def connected(self, path):
+        """A client that asks for nothing: as long as it is there, the helper does not leave."""
+        client = self.lib.bvmh_client_create()
+        try:
+            expect_equal(self.lib.bvmh_client_set_socket(client, path.encode()), 0, "its socket")
+            expect_equal(self.lib.bvmh_connect(client), 0, "its check-in")
+            yield
+        finally:
+            self.lib.bvmh_client_free(client)
+
 
 def zip_of(entries):
     """A stored zip archive of {name: content}."""
@@ -652,15 +663,15 @@ def comes_back_after_a_limit():
 
 
 def upgrade():
-    bvhelperctl("ping")
-    process = property_of(SERVICE, "MainPID")
     ping_sockets = pathlib.Path("/proc/sys/net/ipv4/ping_group_range")
     ping_sockets.write_text("0 7")
-    run("dpkg", "-i", "/packages/upgrade.deb")
+    with Library().connected(PATH):
+        process = property_of(SERVICE, "MainPID")
+        run("dpkg", "-i", "/packages/upgrade.deb")
+        expect_equal(property_of(SOCKET, "ActiveState"), "active", "listens on")
+        expect_equal(property_of(SERVICE, "MainPID"), process, "a helper at work is left alone")
     expect_equal(ping_sockets.read_text().split(), ["0", "7"], "ping sockets that the administrator has opened")
     expect_equal(run("dpkg", "-V", *PACKAGES, check=False).stdout, "", "dpkg --verify")
-    expect_equal(property_of(SOCKET, "ActiveState"), "active", "listens on")
-    expect_equal(property_of(SERVICE, "MainPID"), process, "a helper at work is left alone")
     expect_equal(bvhelperctl("voicemail", "token").stdout, "a-token\n")
     expect(os.path.exists("/etc/brenvik/entitlements.d/50-bvhelperctl.plist"), "entitlements stay")
 
