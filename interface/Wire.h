@@ -27,7 +27,6 @@ inline constexpr KernelReturn memoryFailure = 9;
 inline constexpr KernelReturn invalidName = 15;
 inline constexpr KernelReturn invalidRight = 17;
 inline constexpr KernelReturn invalidSecurity = 35;
-inline constexpr KernelReturn notSupported = 46;
 }  // namespace kern
 
 // Codes of the message layer itself.
@@ -56,13 +55,15 @@ struct [[gnu::packed]] MessageHeader {
   std::uint32_t voucher;
   std::int32_t id;
 };
-static_assert(sizeof(MessageHeader) == 24 && offsetof(MessageHeader, size) == 4 &&
-              offsetof(MessageHeader, replyPort) == 8 && offsetof(MessageHeader, localPort) == 12 &&
-              offsetof(MessageHeader, voucher) == 16 && offsetof(MessageHeader, id) == 20);
+static_assert(sizeof(MessageHeader) == 24 && offsetof(MessageHeader, bits) == 0 &&
+              offsetof(MessageHeader, size) == 4 && offsetof(MessageHeader, replyPort) == 8 &&
+              offsetof(MessageHeader, localPort) == 12 && offsetof(MessageHeader, voucher) == 16 &&
+              offsetof(MessageHeader, id) == 20);
 
 struct [[gnu::packed]] NdrRecord {
   std::uint8_t bytes[8];
 };
+static_assert(sizeof(NdrRecord) == 8);
 inline constexpr NdrRecord kNdrRecord{{0, 0, 0, 0, 1, 0, 0, 0}};
 
 struct [[gnu::packed]] PortDescriptor {
@@ -72,8 +73,8 @@ struct [[gnu::packed]] PortDescriptor {
   std::uint8_t disposition;
   std::uint8_t type;
 };
-static_assert(sizeof(PortDescriptor) == 12 && offsetof(PortDescriptor, disposition) == 10 &&
-              offsetof(PortDescriptor, type) == 11);
+static_assert(sizeof(PortDescriptor) == 12 && offsetof(PortDescriptor, name) == 0 &&
+              offsetof(PortDescriptor, disposition) == 10 && offsetof(PortDescriptor, type) == 11);
 
 struct [[gnu::packed]] OutOfLineDescriptor {
   std::uint64_t address;
@@ -83,7 +84,8 @@ struct [[gnu::packed]] OutOfLineDescriptor {
   std::uint8_t type;
   std::uint32_t size;
 };
-static_assert(sizeof(OutOfLineDescriptor) == 16 && offsetof(OutOfLineDescriptor, deallocate) == 8 &&
+static_assert(sizeof(OutOfLineDescriptor) == 16 && offsetof(OutOfLineDescriptor, address) == 0 &&
+              offsetof(OutOfLineDescriptor, deallocate) == 8 && offsetof(OutOfLineDescriptor, copy) == 9 &&
               offsetof(OutOfLineDescriptor, type) == 11 && offsetof(OutOfLineDescriptor, size) == 12);
 
 // A complex message: the descriptor count follows the header, the descriptors follow the count.
@@ -99,7 +101,9 @@ struct [[gnu::packed]] MessageTrailer {
   std::uint32_t senderGid;
   std::uint32_t auditToken[8];
 };
-static_assert(sizeof(MessageTrailer) == 52 && offsetof(MessageTrailer, sequence) == 8 &&
+static_assert(sizeof(MessageTrailer) == 52 && offsetof(MessageTrailer, type) == 0 &&
+              offsetof(MessageTrailer, size) == 4 && offsetof(MessageTrailer, sequence) == 8 &&
+              offsetof(MessageTrailer, senderUid) == 12 && offsetof(MessageTrailer, senderGid) == 16 &&
               offsetof(MessageTrailer, auditToken) == 20);
 inline constexpr std::uint32_t kMinimalTrailerSize = 8;
 
