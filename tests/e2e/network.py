@@ -231,7 +231,8 @@ class Nginx:
 
     def stop(self):
         if self.process is not None:
-            self.process.terminate()
+            # Not asked to: what it is asked between the start and its first wait for a client, it does after that wait.
+            self.process.kill()
             self.process.wait()
             self.process = None
             (self.folder / "pid").unlink(missing_ok=True)
