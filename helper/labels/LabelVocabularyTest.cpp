@@ -103,6 +103,7 @@ TEST(LabelVocabularyTest, ThreadsThatAskAtTheSameTimeGetTheSameAnswer) {
     allocationsLeft = failed;
     try {
       const PropertyList answer = labelIdentifierForKey("USER_LABEL_CELL_DATA");
+      allocationsLeft = -1;
       ::_exit(answer.asString() == label_identifier::data ? failed : 99);
     } catch (const std::bad_alloc&) {
       allocationsLeft = -1;

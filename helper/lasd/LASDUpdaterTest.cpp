@@ -4,11 +4,13 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <thread>
 
 #include "Helper/Shared/Server/HelperServerUtils.h"
 #include "helper/lasd/DatabaseTypes.h"
 #include "helper/lasd/LasdTestSupport.h"
+#include "platform/base/fakes/FailingAllocations.h"
 #include "platform/ipc/fakes/FakePorts.h"
 #include "platform/messageport/fakes/RecordingMessagePorts.h"
 #include "platform/plist/PropertyListCodec.h"
@@ -196,6 +198,49 @@ TEST_F(LASDUpdaterTest, ACheckThatFindsNoQueueLeavesNoTokenBehind) {
   queues.refuseQueues = true;
   EXPECT_THROW(updater->checkForUpdate(server, 1), std::bad_alloc);
   EXPECT_EQ(server.busyMask, 0U);
+}
+
+// Takes no memory, which the check must have for itself, and remembers whether it was given up.
+class ShortLog final : public LogSink {
+ public:
+  ShortLog() : previous_(setLogSink(this)) {}
+  ShortLog(const ShortLog&) = delete;
+  ShortLog& operator=(const ShortLog&) = delete;
+  ~ShortLog() override { setLogSink(previous_); }
+  void unified(LogLevel, std::string_view line, const LogPlace&, const MessageId&) noexcept override {
+    if (line == "Update check given up: out of memory") isGivenUp = true;
+  }
+  void bsd(SyslogPriority, std::string_view, const MessageId&) noexcept override {}
+
+  std::atomic<bool> isGivenUp = false;
+
+ private:
+  LogSink* const previous_;
+};
+
+TEST_F(LASDUpdaterTest, AManifestThatCannotBeReadForLackOfMemoryIsNotTakenForNothingToDo) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "nothing fails under this sanitizer";
+  serveAll("1.0");
+  bool anyFailed = true;
+  int givenUp = 0;
+  for (long number = 0; anyFailed; ++number) {
+    ASSERT_LT(number, 10'000);
+    const std::size_t before = notifications().size();
+    updater->checkForUpdate(server, 0);
+    const ShortLog shortLog;
+    {
+      const FailingAllocations failing(number, FailingAllocations::HowMany::one);
+      queues.updater->runReady();
+      anyFailed = FailingAllocations::failures() > 0;
+    }
+    EXPECT_EQ(server.busyMask, 0U) << number;
+    if (shortLog.isGivenUp) {
+      ++givenUp;
+      EXPECT_EQ(notifications().size(), before) << number;
+    }
+  }
+  EXPECT_GT(givenUp, 10) << "five databases of several texts each";
+  EXPECT_EQ(notifications().back(), "NoUpdateRequired");
 }
 
 TEST_F(LASDUpdaterTest, Mask0ReadsNoPreferenceAndStillFetchesTheManifest) {

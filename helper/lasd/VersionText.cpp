@@ -6,8 +6,8 @@
 #include <wctype.h>
 
 #include <algorithm>
-#include <atomic>
 #include <cstdint>
+#include <mutex>
 
 namespace brenvik {
 namespace {
@@ -42,17 +42,11 @@ std::uint32_t withoutCase(std::uint32_t character) noexcept {
   if (character < 0x80) return character >= 'A' && character <= 'Z' ? character + ('a' - 'A') : character;
   // The process's own locale is "C", which knows no letters but ASCII's. Never freed: it serves until exit.
   // Where it cannot be had now, the next call tries again.
-  static std::atomic<locale_t> shared{nullptr};
-  locale_t utf8 = shared.load(std::memory_order_acquire);
-  if (utf8 == nullptr) {
-    const locale_t made = ::newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr);
-    if (made == nullptr) return character;
-    if (shared.compare_exchange_strong(utf8, made)) {
-      utf8 = made;
-    } else {
-      ::freelocale(made);
-    }
-  }
+  static std::mutex mutex;
+  static locale_t utf8 = nullptr;
+  const std::lock_guard lock(mutex);
+  if (utf8 == nullptr) utf8 = ::newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr);
+  if (utf8 == nullptr) return character;
   return static_cast<std::uint32_t>(::towlower_l(::towupper_l(character, utf8), utf8));
 }
 

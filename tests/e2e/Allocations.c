@@ -62,7 +62,13 @@ __attribute__((constructor)) static void share(void) {
   shared = file;
 }
 
+/* For a coverage build, which writes its counts at the very end. */
+static bool granted;
+void brenvik_grant_memory(void);
+void brenvik_grant_memory(void) { granted = true; }
+
 static bool fails(void) {
+  if (granted) return false;
   const uint64_t number = __atomic_add_fetch(&shared->made, 1, __ATOMIC_RELAXED);
   if (__atomic_load_n(&shared->armed, __ATOMIC_ACQUIRE) == 0) return false;
   if (number < shared->first || number > shared->last) return false;

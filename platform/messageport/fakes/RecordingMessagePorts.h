@@ -3,6 +3,7 @@
 #pragma once
 
 #include <mutex>
+#include <new>
 #include <string>
 #include <utility>
 #include <vector>
@@ -27,20 +28,24 @@ class RecordingMessagePorts final : public MessagePorts {
     return messages_;
   }
 
-  std::unique_ptr<RemoteMessagePort> openRemote(const std::string& name) noexcept override {
+  std::unique_ptr<RemoteMessagePort> openRemote(const std::string& name) noexcept override try {
     if (nobodyListens) return nullptr;
     return std::make_unique<Port>(*this, name);
+  } catch (const std::bad_alloc&) {
+    return nullptr;
   }
 
  private:
   class Port final : public RemoteMessagePort {
    public:
     Port(RecordingMessagePorts& ports, std::string name) : ports_(ports), name_(std::move(name)) {}
-    bool send(std::int32_t messageId, std::span<const std::byte> data) noexcept override {
+    bool send(std::int32_t messageId, std::span<const std::byte> data) noexcept override try {
       if (ports_.listenerIsBusy) return false;
       const std::lock_guard lock(ports_.mutex_);
       ports_.messages_.push_back({name_, messageId, {data.begin(), data.end()}});
       return true;
+    } catch (const std::bad_alloc&) {
+      return false;
     }
 
    private:
