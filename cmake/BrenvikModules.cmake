@@ -5,9 +5,11 @@
 # the build tree, under the path they have in the source tree), so an include of a folder that is not
 # among a target's dependencies does not build. That is what keeps the arrows pointing one way.
 
-find_package(PkgConfig REQUIRED)
 find_package(Threads REQUIRED)
-pkg_check_modules(systemd REQUIRED IMPORTED_TARGET libsystemd)
+if(NOT BRENVIK_CLIENT_ONLY)
+  find_package(PkgConfig REQUIRED)
+  pkg_check_modules(systemd REQUIRED IMPORTED_TARGET libsystemd)
+endif()
 if(BUILD_TESTING)
   find_package(GTest REQUIRED)
   # The test framework's headers are the larger part of what a test costs to compile, so they are compiled once.

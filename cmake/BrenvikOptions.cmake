@@ -9,6 +9,13 @@ option(BRENVIK_FUZZ "Build the fuzz targets with libFuzzer (needs clang)" OFF)
 option(BRENVIK_BENCHMARKS "Build the benchmarks" OFF)
 option(BRENVIK_STATIC_RUNTIME "Link libstdc++ and libgcc statically into the daemon: 0.4 ms less at each start" OFF)
 option(BRENVIK_COVERAGE "Instrument for line and branch coverage (gcov)" OFF)
+option(BRENVIK_WERROR "Warnings are errors. On for us; a packager, whose compiler may be newer, switches it off" ON)
+option(BRENVIK_CLIENT_ONLY "Build the client library alone: it needs a compiler and nothing else" OFF)
+
+# The messages are laid out in memory as they travel, and they travel in little-endian order.
+if(CMAKE_CXX_BYTE_ORDER STREQUAL "BIG_ENDIAN")
+  message(FATAL_ERROR "BrenvikMobileHelper runs on little-endian machines only; ${CMAKE_SYSTEM_PROCESSOR} is not one.")
+endif()
 
 set(BRENVIK_BOOTSTRAP_DIRECTORY "/run/brenvik/bootstrap" CACHE STRING "Socket files of named services")
 set(BRENVIK_ENTITLEMENT_DIRECTORIES "/etc/brenvik/entitlements.d;/usr/lib/brenvik/entitlements.d"
@@ -25,17 +32,33 @@ set(BRENVIK_VISUAL_VOICEMAIL_LIBRARY "libbrenvik-visualvoicemail.so.0" CACHE STR
 set(BRENVIK_VISUAL_VOICEMAIL_SYMBOL "_VisualVoicemailIsSubscribed" CACHE STRING "Subscription query: symbol")
 set(BRENVIK_BASEBAND_LIBRARY "libbrenvik-baseband-helper.so.0" CACHE STRING "Optional hosted baseband server")
 
-# Warnings are errors, in every build. A target that is ours links brenvik_flags.
+# A target that is ours links brenvik_flags. What not every compiler knows is asked for first.
+include(CheckCXXCompilerFlag)
+include(CheckLinkerFlag)
 add_library(brenvik_flags INTERFACE)
-target_compile_options(brenvik_flags INTERFACE
-  -Wall -Wextra -Wpedantic -Werror -Wshadow -Wnon-virtual-dtor -Wold-style-cast -Wcast-align -Wunused
-  -Woverloaded-virtual -Wconversion -Wsign-conversion -Wdouble-promotion -Wformat=2 -Wimplicit-fallthrough
-  -fstack-protector-strong -fno-plt)
-# g++ 12 sees overlaps in std::string concatenation that are not there (GCC bug 105651), when it optimises.
-target_compile_options(brenvik_flags INTERFACE $<$<CONFIG:Release>:-Wno-restrict>)
-target_compile_definitions(brenvik_flags INTERFACE _GNU_SOURCE)
 add_library(brenvik_c_flags INTERFACE)
-target_compile_options(brenvik_c_flags INTERFACE -Wall -Wextra -Wpedantic -Werror -Wshadow -Wconversion)
+target_compile_definitions(brenvik_flags INTERFACE _GNU_SOURCE)
+target_compile_options(brenvik_flags INTERFACE
+  -Wall -Wextra -Wpedantic -Wshadow -Wnon-virtual-dtor -Wold-style-cast -Wcast-align -Wunused
+  -Woverloaded-virtual -Wconversion -Wsign-conversion -Wdouble-promotion -Wformat=2 -Wimplicit-fallthrough)
+target_compile_options(brenvik_c_flags INTERFACE -Wall -Wextra -Wpedantic -Wshadow -Wconversion)
+foreach(flag -fstack-protector-strong -fno-plt)
+  string(MAKE_C_IDENTIFIER "BRENVIK_HAS${flag}" known)
+  check_cxx_compiler_flag(${flag} ${known})
+  if(${known})
+    target_compile_options(brenvik_flags INTERFACE ${flag})
+  endif()
+endforeach()
+# g++ 12 sees overlaps in std::string concatenation that are not there (GCC bug 105651), when it optimises. The
+# positive form is asked for, because g++ takes any -Wno- without a word.
+check_cxx_compiler_flag(-Wrestrict BRENVIK_HAS_Wrestrict)
+if(BRENVIK_HAS_Wrestrict)
+  target_compile_options(brenvik_flags INTERFACE $<$<NOT:$<CONFIG:Debug>>:-Wno-restrict>)
+endif()
+if(BRENVIK_WERROR)
+  target_compile_options(brenvik_flags INTERFACE -Werror)
+  target_compile_options(brenvik_c_flags INTERFACE -Werror)
+endif()
 
 if(BRENVIK_SANITIZE)
   add_compile_options(-fsanitize=${BRENVIK_SANITIZE} -fno-omit-frame-pointer -fno-sanitize-recover=all)
@@ -70,8 +93,12 @@ if(BRENVIK_FUZZ)
 endif()
 if(NOT BRENVIK_SANITIZE AND NOT BRENVIK_FUZZ AND CMAKE_BUILD_TYPE STREQUAL "Release")
   add_compile_definitions(_FORTIFY_SOURCE=2)
+  add_link_options(-Wl,-z,relro,-z,now -Wl,--as-needed -Wl,--gc-sections)
   # Packed relocations: fewer pages to read at each start.
-  add_link_options(-Wl,-z,relro,-z,now -Wl,-z,pack-relative-relocs -Wl,--as-needed -Wl,--gc-sections)
+  check_linker_flag(CXX -Wl,-z,pack-relative-relocs BRENVIK_HAS_PACKED_RELOCATIONS)
+  if(BRENVIK_HAS_PACKED_RELOCATIONS)
+    add_link_options(-Wl,-z,pack-relative-relocs)
+  endif()
   add_compile_options(-ffunction-sections -fdata-sections)
   # Log entries name their source file. It is named from the root of the sources, wherever that is, and whether a
   # compiler cache has made the path relative to the build folder or not: what is installed is the same.

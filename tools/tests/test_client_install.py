@@ -91,6 +91,36 @@ class InstalledClient(unittest.TestCase):
         needed = set(re.findall(r"NEEDED +(\S+)", run("objdump", "-p", self.library)))
         self.assertLessEqual(needed, {"libc.so.6", "libstdc++.so.6", "libgcc_s.so.1"})
 
+    def test_the_library_alone_builds_without_any_other_package(self):
+        build = self.folder / "client-only"
+        # Nothing that pkg-config could find may be needed.
+        environment = {**os.environ, "PKG_CONFIG_LIBDIR": str(self.folder / "none")}
+        run("cmake", "-S", SOURCE, "-B", build, "-G", "Ninja", "-DBRENVIK_CLIENT_ONLY=ON", "-DBUILD_TESTING=OFF",
+            f"-DCMAKE_INSTALL_PREFIX={self.folder / 'alone'}", env=environment)
+        run("cmake", "--build", build)
+        run("cmake", "--install", build)
+        self.assertTrue((self.folder / "alone" / "include" / "brenvik" / "mobile_helper.h").exists())
+        self.assertEqual({each.name for each in build.glob("B*Helper")}, set(), "the daemon was built, too")
+
+
+class Options(unittest.TestCase):
+    def options(self, **values):
+        return subprocess.run(["cmake", *(f"-D{name}={value}" for name, value in values.items()), "-P",
+                               SOURCE / "cmake" / "BrenvikOptions.cmake"], capture_output=True, text=True, timeout=60,
+                              check=False)
+
+    def test_a_big_endian_machine_is_refused_with_a_sentence(self):
+        refused = self.options(CMAKE_CXX_BYTE_ORDER="BIG_ENDIAN", CMAKE_SYSTEM_PROCESSOR="s390x")
+        self.assertNotEqual(refused.returncode, 0)
+        self.assertIn("runs on little-endian machines only; s390x is not one.", " ".join(refused.stderr.split()))
+
+    def test_warnings_are_errors_unless_they_are_switched_off(self):
+        for given, expected in (([], True), (["-DBRENVIK_WERROR=OFF"], False)):
+            with tempfile.TemporaryDirectory(prefix="client-werror-") as build:
+                run("cmake", "-S", SOURCE, "-B", build, "-G", "Ninja", "-DBRENVIK_CLIENT_ONLY=ON", "-DBUILD_TESTING=OFF",
+                    *given)
+                self.assertEqual("-Werror" in (pathlib.Path(build) / "build.ninja").read_text(), expected)
+
 
 if __name__ == "__main__":
     unittest.main()
