@@ -48,6 +48,8 @@ extern "C" const char* bvmh_error_text(int32_t code) {
       return "a system call failed";
     case BVMH_ERROR_NAME_IN_USE:
       return "another process serves that name";
+    case BVMH_ERROR_NOT_HANDED_OVER:
+      return "the service manager handed over no such socket";
     case BVMH_ERROR_NO_LONGER_THERE:
       return "the sender no longer waits for an answer";
     default:

@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "client/Listener.h"
 
+#include <fcntl.h>
 #include <sys/epoll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -12,6 +13,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <utility>
 
 #include "interface/Messages.h"
 #include "interface/TelephonyMessages.h"
@@ -63,8 +65,27 @@ MessageHeader replyHeader(std::uint32_t size, PortName replyPort, std::int32_t r
 
 }  // namespace
 
+bool isServiceSocket(int descriptor) noexcept {
+  const auto option = [&](int name) {
+    int value = -1;
+    socklen_t size = sizeof value;
+    return ::getsockopt(descriptor, SOL_SOCKET, name, &value, &size) == 0 ? value : -1;
+  };
+  return option(SO_DOMAIN) == AF_UNIX && option(SO_TYPE) == SOCK_SEQPACKET && option(SO_ACCEPTCONN) == 1;
+}
+
+bool ServiceSocket::adopt(int descriptor) noexcept {
+  const int flags = ::fcntl(descriptor, F_GETFL);
+  if (flags < 0 || ::fcntl(descriptor, F_SETFL, flags | O_NONBLOCK) != 0 ||
+      ::fcntl(descriptor, F_SETFD, FD_CLOEXEC) != 0) {
+    return false;
+  }
+  socket_.reset(descriptor);
+  return true;
+}
+
 ServiceSocket::~ServiceSocket() {
-  if (!socket_.isValid()) return;
+  if (!socket_.isValid() || address_.sun_path[0] == '\0') return;
   struct stat facts {};
   if (::lstat(address_.sun_path, &facts) == 0 && facts.st_dev == device_ && facts.st_ino == inode_) {
     ::unlink(address_.sun_path);
@@ -115,11 +136,40 @@ std::int32_t Listener::systemFailure() noexcept {
   return BVMH_ERROR_SYSTEM;
 }
 
-std::int32_t Listener::open(const char* directory, unsigned services) noexcept {
+std::int32_t Listener::prepare() noexcept {
   systemError_ = 0;
   if (!buffer_.ensure()) return BVMH_ERROR_NO_MEMORY;
   poll_.reset(::epoll_create1(EPOLL_CLOEXEC));
-  if (!poll_.isValid()) return systemFailure();
+  return poll_.isValid() ? BVMH_OK : systemFailure();
+}
+
+std::int32_t Listener::watch(Service service) noexcept {
+  epoll_event event{};
+  event.events = EPOLLIN;
+  event.data.u64 = static_cast<std::uint64_t>(service);
+  const int socket = services_[static_cast<std::size_t>(service)].get();
+  return ::epoll_ctl(poll_.get(), EPOLL_CTL_ADD, socket, &event) == 0 ? BVMH_OK : systemFailure();
+}
+
+std::int32_t Listener::open(int pushes, int notifications) noexcept {
+  for (const int each : {pushes, notifications}) {
+    if (each != -1 && !isServiceSocket(each)) return BVMH_ERROR_INVALID_ARGUMENT;
+  }
+  if (pushes == notifications) return BVMH_ERROR_INVALID_ARGUMENT;
+  std::int32_t code = prepare();
+  for (const auto& [service, socket] :
+       {std::pair(Service::pushes, pushes), std::pair(Service::notifications, notifications)}) {
+    if (code != BVMH_OK || socket == -1) continue;
+    code = services_[static_cast<std::size_t>(service)].adopt(socket) ? watch(service) : systemFailure();
+  }
+  if (code != BVMH_OK) {
+    for (ServiceSocket& each : services_) each.giveBack();
+  }
+  return code;
+}
+
+std::int32_t Listener::open(const char* directory, unsigned services) noexcept {
+  if (const std::int32_t code = prepare(); code != BVMH_OK) return code;
   struct Named {
     unsigned bit;
     Service service;
@@ -132,10 +182,7 @@ std::int32_t Listener::open(const char* directory, unsigned services) noexcept {
     const std::int32_t code = socket.listenAt(directory, each.name);
     if (code == BVMH_ERROR_SYSTEM) return systemFailure();
     if (code != BVMH_OK) return code;
-    epoll_event event{};
-    event.events = EPOLLIN;
-    event.data.u64 = static_cast<std::uint64_t>(each.service);
-    if (::epoll_ctl(poll_.get(), EPOLL_CTL_ADD, socket.get(), &event) != 0) return systemFailure();
+    if (const std::int32_t watched = watch(each.service); watched != BVMH_OK) return watched;
   }
   return BVMH_OK;
 }

@@ -12,7 +12,11 @@
 
 namespace brenvik::client {
 
-// The socket file of a named service, removed again as long as it is still ours.
+// True for a listening socket of the type that named services have.
+bool isServiceSocket(int descriptor) noexcept;
+
+// The listening socket of a named service. A socket file that it made is removed again as long as it is still
+// there.
 class ServiceSocket {
  public:
   ServiceSocket() = default;
@@ -21,6 +25,12 @@ class ServiceSocket {
   ~ServiceSocket();
   // Replaces a file that nobody serves. Codes of mobile_helper.h; errno stands after BVMH_ERROR_SYSTEM.
   std::int32_t listenAt(const char* directory, const char* name) noexcept;
+  // Takes over a socket that somebody else made, whose file is theirs. Precondition: isServiceSocket(). False
+  // with errno set when it cannot be made non-blocking and close-on-exec; then the descriptor stays the
+  // caller's.
+  bool adopt(int descriptor) noexcept;
+  // Gives an adopted descriptor back to whoever gave it.
+  void giveBack() noexcept { (void)socket_.release(); }
   int get() const noexcept { return socket_.get(); }
 
  private:
@@ -34,6 +44,8 @@ class ServiceSocket {
 class Listener {
  public:
   std::int32_t open(const char* directory, unsigned services) noexcept;
+  // Descriptors of listening sockets, -1 for none. They are the listener's on BVMH_OK only.
+  std::int32_t open(int pushes, int notifications) noexcept;
   int descriptor() const noexcept { return poll_.get(); }
   int systemError() const noexcept { return systemError_; }
   void allow(uid_t uid) noexcept { allowedUid_ = uid; }
@@ -54,6 +66,8 @@ class Listener {
   };
 
   std::int32_t systemFailure() noexcept;
+  std::int32_t prepare() noexcept;
+  std::int32_t watch(Service service) noexcept;
   std::int32_t accept(Service service) noexcept;
   // Reads one message; true when it was one for the caller.
   bool read(Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;

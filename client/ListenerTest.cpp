@@ -359,6 +359,140 @@ TEST_F(ListenerTest, DoesNotRemoveASocketThatTookItsPlace) {
   const UniqueFd helper = connect(kPushes);
 }
 
+// A listening socket of a named service, as a service manager makes it.
+UniqueFd listeningAt(const std::string& path, int type = SOCK_SEQPACKET) {
+  UniqueFd socket(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::memcpy(address.sun_path, path.data(), path.size());
+  EXPECT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+  EXPECT_EQ(::listen(socket.get(), 4), 0);
+  return socket;
+}
+
+TEST_F(ListenerTest, ServesSocketsThatSomebodyElseMadeAndLeavesTheirFiles) {
+  UniqueFd pushes = listeningAt(directory_.path() + kPushes);
+  UniqueFd notifications = listeningAt(directory_.path() + kNotifications);
+  bvmh_listener* made = nullptr;
+  ASSERT_EQ(bvmh_listener_create_from_fds(pushes.get(), notifications.get(), &made), BVMH_OK);
+  listener_.reset(made);
+  EXPECT_EQ(::fcntl(pushes.get(), F_GETFD), FD_CLOEXEC);
+  EXPECT_NE(::fcntl(pushes.get(), F_GETFL) & O_NONBLOCK, 0);
+  (void)pushes.release();
+  (void)notifications.release();
+
+  const UniqueFd helper = connect(kPushes);
+  send(helper, push(9100002, 77, kAddressList));
+  EXPECT_EQ(next(BVMH_EVENT_LOCAL_ADDRESS), kAddressList);
+  const UniqueFd updater = connect(kNotifications);
+  send(updater, Bytes(24).append("news"));
+  EXPECT_EQ(next(BVMH_EVENT_NOTIFICATION), "news");
+  bvmh_event_free(&event_);
+
+  listener_.reset();
+  EXPECT_EQ(::access((directory_.path() + kPushes).c_str(), F_OK), 0);
+  EXPECT_EQ(::access((directory_.path() + kNotifications).c_str(), F_OK), 0);
+}
+
+TEST_F(ListenerTest, OneOfTheTwoSocketsIsEnough) {
+  UniqueFd pushes = listeningAt(directory_.path() + kPushes);
+  bvmh_listener* made = nullptr;
+  ASSERT_EQ(bvmh_listener_create_from_fds(pushes.get(), -1, &made), BVMH_OK);
+  listener_.reset(made);
+  (void)pushes.release();
+  const UniqueFd helper = connect(kPushes);
+  send(helper, push(9100002, 77, kAddressList));
+  EXPECT_EQ(next(BVMH_EVENT_LOCAL_ADDRESS), kAddressList);
+  bvmh_event_free(&event_);
+}
+
+TEST_F(ListenerTest, AForeignDescriptorHandedOverAsAServiceSocketIsRefusedAndStaysTheCallers) {
+  const UniqueFd good = listeningAt(directory_.path() + kPushes);
+  const UniqueFd stream = listeningAt(directory_.path() + "/stream", SOCK_STREAM);
+  const UniqueFd file(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+  const UniqueFd quiet(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+  const UniqueFd internet(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  bvmh_listener* made = nullptr;
+  for (const int wrong : {stream.get(), file.get(), quiet.get(), internet.get(), good.get(), -2, 1 << 20}) {
+    SCOPED_TRACE(wrong);
+    EXPECT_EQ(bvmh_listener_create_from_fds(good.get(), wrong, &made), BVMH_ERROR_INVALID_ARGUMENT);
+    EXPECT_EQ(made, nullptr);
+  }
+  EXPECT_EQ(bvmh_listener_create_from_fds(-1, -1, &made), BVMH_ERROR_INVALID_ARGUMENT);
+  for (const UniqueFd* each : {&good, &stream, &file, &quiet, &internet}) {
+    EXPECT_NE(::fcntl(each->get(), F_GETFD), -1) << "it was closed";
+  }
+}
+
+// Runs the work in a process to which a service manager has handed the sockets, from descriptor 3 on. Its
+// exit status.
+template <class Work>
+int inProcessHandedOver(const std::vector<int>& sockets, const char* names, pid_t* other, Work work) {
+  const pid_t child = ::fork();
+  if (child == 0) {
+    // Out of the way of the places that they are to have.
+    std::vector<int> copies;
+    for (const int each : sockets) copies.push_back(::fcntl(each, F_DUPFD, 100));
+    for (std::size_t i = 0; i < copies.size(); ++i) ::dup2(copies[i], static_cast<int>(3 + i));
+    ::setenv("LISTEN_PID", std::to_string(other != nullptr ? *other : ::getpid()).c_str(), 1);
+    ::setenv("LISTEN_FDS", std::to_string(sockets.size()).c_str(), 1);
+    ::setenv("LISTEN_FDNAMES", names, 1);
+    ::_exit(work());
+  }
+  int status = 0;
+  EXPECT_EQ(::waitpid(child, &status, 0), child);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+TEST_F(ListenerTest, FindsTheSocketsOfAServiceManagerByTheirNames) {
+  const UniqueFd other = listeningAt(directory_.path() + "/other");
+  const UniqueFd pushes = listeningAt(directory_.path() + kPushes);
+  const UniqueFd notifications = listeningAt(directory_.path() + kNotifications);
+  const UniqueFd helper = connect(kPushes);
+  send(helper, push(9100002, 77, kAddressList));
+  const UniqueFd updater = connect(kNotifications);
+  send(updater, Bytes(24).append("news"));
+  const auto work = [] {
+    bvmh_listener* made = nullptr;
+    if (bvmh_listener_create_from_environment(BVMH_PUSHES | BVMH_NOTIFICATIONS, &made) != BVMH_OK) return 1;
+    unsigned seen = 0;
+    for (int i = 0; i < 2; ++i) {
+      bvmh_event event{};
+      if (bvmh_listener_next(made, kPlenty, &event) != BVMH_OK) return 2;
+      seen |= 1U << event.kind;
+      bvmh_event_free(&event);
+    }
+    bvmh_listener_free(made);
+    if (::fcntl(3, F_GETFD) == -1) return 3;  // that of another name
+    return seen == (1U << BVMH_EVENT_LOCAL_ADDRESS | 1U << BVMH_EVENT_NOTIFICATION) ? 0 : 4;
+  };
+  EXPECT_EQ(inProcessHandedOver({other.get(), notifications.get(), pushes.get()},
+                                "other:com.norvale.Brenvik.lasd:com.norvale.brenvik", nullptr, work),
+            0);
+}
+
+TEST_F(ListenerTest, SocketsThatWereHandedToNobodyOrSomebodyElseAreNotTaken) {
+  const UniqueFd pushes = listeningAt(directory_.path() + kPushes);
+  const auto notHandedOver = [] {
+    bvmh_listener* made = nullptr;
+    const std::int32_t code = bvmh_listener_create_from_environment(BVMH_PUSHES | BVMH_NOTIFICATIONS, &made);
+    return code == BVMH_ERROR_NOT_HANDED_OVER && made == nullptr && ::fcntl(3, F_GETFD) != -1 ? 0 : 1;
+  };
+  const std::vector<int> one{pushes.get()};
+  pid_t somebody = ::getpid();
+  EXPECT_EQ(inProcessHandedOver(one, "com.norvale.brenvik", &somebody, notHandedOver), 0);
+  EXPECT_EQ(inProcessHandedOver(one, "com.norvale.brenvik.mobile-helper", nullptr, notHandedOver), 0);
+  EXPECT_EQ(inProcessHandedOver(one, "", nullptr, notHandedOver), 0);
+  // More names than descriptors.
+  EXPECT_EQ(inProcessHandedOver(one, "other:com.norvale.brenvik", nullptr, notHandedOver), 0);
+  const auto wantsTheOther = [] {
+    bvmh_listener* made = nullptr;
+    return bvmh_listener_create_from_environment(BVMH_NOTIFICATIONS, &made) == BVMH_ERROR_NOT_HANDED_OVER ? 0
+                                                                                                          : 1;
+  };
+  EXPECT_EQ(inProcessHandedOver(one, "com.norvale.brenvik", nullptr, wantsTheOther), 0);
+}
+
 TEST_F(ListenerTest, OtherUsersAreTurnedAwayUnlessAllowed) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs the superuser to become somebody else";
   ASSERT_EQ(::chmod(directory_.path().c_str(), 0755), 0);

@@ -11,7 +11,9 @@
 
 #include "client/Client.h"
 #include "client/EventText.h"
+#include "client/HandedOver.h"
 #include "client/Listener.h"
+#include "interface/TelephonyMessages.h"
 
 // The C functions: arguments into the message structs, replies into the caller's variables.
 
@@ -109,6 +111,26 @@ class Call {
   bool isValid_ = true;
   Reply reply_;
 };
+
+bool areServices(unsigned bits) noexcept {
+  return bits != 0 && (bits & ~unsigned{BVMH_PUSHES | BVMH_NOTIFICATIONS}) == 0;
+}
+
+// Opens a new listener as Listener::open is told. errno stands after BVMH_ERROR_SYSTEM.
+template <class... Arguments>
+std::int32_t makeListener(bvmh_listener** listener, Arguments... arguments) noexcept {
+  auto* made = new (std::nothrow) bvmh_listener;
+  if (made == nullptr) return BVMH_ERROR_NO_MEMORY;
+  const std::int32_t code = made->listener.open(arguments...);
+  if (code == BVMH_OK) {
+    *listener = made;
+    return code;
+  }
+  const int error = made->listener.systemError();
+  delete made;
+  errno = error;
+  return code;
+}
 
 }  // namespace
 }  // namespace brenvik::client
@@ -362,21 +384,28 @@ int32_t BVMobileHelperEnableRadioManagerLogs(bvmh_client* client, int32_t enable
 int32_t bvmh_listener_create(const char* directory, unsigned services, bvmh_listener** listener) {
   if (listener == nullptr) return BVMH_ERROR_INVALID_ARGUMENT;
   *listener = nullptr;
-  if (services == 0 || (services & ~unsigned{BVMH_PUSHES | BVMH_NOTIFICATIONS}) != 0) {
-    return BVMH_ERROR_INVALID_ARGUMENT;
-  }
-  auto* made = new (std::nothrow) bvmh_listener;
-  if (made == nullptr) return BVMH_ERROR_NO_MEMORY;
-  const std::int32_t code =
-      made->listener.open(directory == nullptr ? bvmh_bootstrap_directory() : directory, services);
-  if (code == BVMH_OK) {
-    *listener = made;
-  } else {
-    const int error = made->listener.systemError();
-    delete made;
-    errno = error;
-  }
-  return code;
+  if (!client::areServices(services)) return BVMH_ERROR_INVALID_ARGUMENT;
+  return client::makeListener(listener, directory == nullptr ? bvmh_bootstrap_directory() : directory,
+                              services);
+}
+
+int32_t bvmh_listener_create_from_fds(int pushes, int notifications, bvmh_listener** listener) {
+  if (listener == nullptr) return BVMH_ERROR_INVALID_ARGUMENT;
+  *listener = nullptr;
+  return client::makeListener(listener, pushes, notifications);
+}
+
+int32_t bvmh_listener_create_from_environment(unsigned services, bvmh_listener** listener) {
+  if (listener == nullptr) return BVMH_ERROR_INVALID_ARGUMENT;
+  *listener = nullptr;
+  if (!client::areServices(services)) return BVMH_ERROR_INVALID_ARGUMENT;
+  const auto handedOver = [&](unsigned service, const char* name) {
+    return (services & service) != 0 ? client::descriptorHandedOver(name) : -1;
+  };
+  const int pushes = handedOver(BVMH_PUSHES, kTelephonyServiceName);
+  const int notifications = handedOver(BVMH_NOTIFICATIONS, kNotificationServiceName);
+  if (pushes == -1 && notifications == -1) return BVMH_ERROR_NOT_HANDED_OVER;
+  return client::makeListener(listener, pushes, notifications);
 }
 
 void bvmh_listener_free(bvmh_listener* listener) { delete listener; }

@@ -100,13 +100,21 @@ std::string eventLine(const bvmh_event& event, const std::string& answer, bool a
 
 int printEvents(const EventStreamOptions& given) {
   EventStreamOptions options = given;
-  if (options.directory.empty()) options.directory = bvmh_bootstrap_directory();
   const UniqueFd signals = endingSignals();
   if (!signals.isValid()) return cannotListen(options, BVMH_ERROR_SYSTEM, errno);
 
+  constexpr unsigned kBoth = BVMH_PUSHES | BVMH_NOTIFICATIONS;
   bvmh_listener* made = nullptr;
-  const std::int32_t created =
-      bvmh_listener_create(options.directory.c_str(), BVMH_PUSHES | BVMH_NOTIFICATIONS, &made);
+  // Sockets that a service manager handed over come first, unless a folder was asked for.
+  std::int32_t created = BVMH_ERROR_NOT_HANDED_OVER;
+  if (options.directory.empty()) {
+    created = bvmh_listener_create_from_environment(kBoth, &made);
+    options.directory = created == BVMH_ERROR_NOT_HANDED_OVER ? bvmh_bootstrap_directory()
+                                                              : "the sockets of the service manager";
+  }
+  if (created == BVMH_ERROR_NOT_HANDED_OVER) {
+    created = bvmh_listener_create(options.directory.c_str(), kBoth, &made);
+  }
   const std::unique_ptr<bvmh_listener, FreeListener> listener(made);
   if (created != BVMH_OK) return cannotListen(options, created, errno);
   if (options.helperUid) bvmh_listener_allow_uid(listener.get(), *options.helperUid);

@@ -63,6 +63,7 @@ enum {
 
   /* the transport's own */
   BVMH_ERROR_FIRST = -7099,
+  BVMH_ERROR_NOT_HANDED_OVER = -7012, /* listener: the service manager gave this process no such socket */
   BVMH_ERROR_NO_LONGER_THERE = -7011, /* listener: the sender of the push has gone */
   BVMH_ERROR_NAME_IN_USE = -7010,     /* listener: another live process serves the name */
   BVMH_ERROR_SYSTEM = -7009,          /* a system call failed: see bvmh_client_errno */
@@ -263,9 +264,27 @@ enum { BVMH_PUSHES = 1, BVMH_NOTIFICATIONS = 2 };
  */
 BVMH_API BVMH_CHECKED int32_t bvmh_listener_create(const char* directory, unsigned services,
                                                    bvmh_listener** listener);
+/*
+ * Listens on sockets that somebody else made: for a daemon that may not write the folder of named services.
+ * Each is a listening AF_UNIX socket of type SOCK_SEQPACKET, or -1 for a service that is not wanted; at least
+ * one is given. On BVMH_OK both descriptors are the listener's: they become non-blocking and close-on-exec,
+ * and are closed with it; their socket files stay. On any other result they stay the caller's.
+ * BVMH_ERROR_INVALID_ARGUMENT: one of them is no such socket, or both are the same.
+ */
+BVMH_API BVMH_CHECKED int32_t bvmh_listener_create_from_fds(int pushes, int notifications,
+                                                            bvmh_listener** listener);
+/*
+ * The same with the sockets that the service manager handed to this process (LISTEN_PID, LISTEN_FDS and
+ * LISTEN_FDNAMES, as sd_listen_fds(3) describes them), found by name: "com.norvale.brenvik" for pushes,
+ * "com.norvale.Brenvik.lasd" for notifications. Takes what is there of the services whose bits are set;
+ * descriptors with other names are left alone. BVMH_ERROR_NOT_HANDED_OVER: there is neither of them. Reads
+ * the environment and leaves it as it is; may be called once.
+ */
+BVMH_API BVMH_CHECKED int32_t bvmh_listener_create_from_environment(unsigned services,
+                                                                    bvmh_listener** listener);
 /* Takes messages from one more user, for a helper that runs under an account of its own. */
 BVMH_API void bvmh_listener_allow_uid(bvmh_listener* listener, uint32_t uid);
-/* Stops listening and removes the socket files. NULL is allowed. */
+/* Stops listening and removes the socket files that bvmh_listener_create made. NULL is allowed. */
 BVMH_API void bvmh_listener_free(bvmh_listener* listener);
 /* A descriptor that is readable when bvmh_listener_next has something to do; the listener's own. */
 BVMH_API int bvmh_listener_fd(const bvmh_listener* listener);
