@@ -518,6 +518,38 @@ def other_accounts_are_told_apart():
     run("setpriv", "--reuid=telephony", "--regid=telephony", "--clear-groups", "bvhelperctl", "ping")
 
 
+def a_telephony_daemon_without_rights_lives_with_it():
+    """The example that comes with the library, installed as its page says."""
+    example = "/usr/share/doc/libbrenvik-mobile-helper-dev/examples/brenvikd"
+    units = ("brenvikd.socket", "brenvikd-lasd.socket", "brenvikd.service")
+    installed = [("/test/brenvikd", "/usr/libexec/brenvikd", 755),
+                 (f"{example}/brenvikd.sysusers", "/etc/sysusers.d/brenvikd.conf", 644),
+                 (f"{example}/60-brenvikd.plist", "/etc/brenvik/entitlements.d/60-brenvikd.plist", 644),
+                 *((f"{example}/{unit}", f"/etc/systemd/system/{unit}", 644) for unit in units)]
+    made = [] if os.path.exists("/etc/sysusers.d") else ["/etc/sysusers.d"]
+    for source, target, mode in installed:
+        run("install", "-D", "-m", str(mode), source, target)
+    run("systemd-sysusers")
+    run("systemctl", "daemon-reload")
+    run("systemctl", "start", "brenvikd.service")
+
+    def told():
+        return run("journalctl", "-u", "brenvikd.service", "-o", "cat").stdout
+
+    wait_for(lambda: 'country "NO", city "Oslo"' in told(), "the push of where it is")
+    expect_equal(property_of("brenvikd.service", "User"), "brenvikd")
+    with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as updater:
+        updater.connect("/run/brenvik/bootstrap/com.norvale.Brenvik.lasd")
+        updater.send(struct.pack("<6I", 0, 24, 0, 0, 0, 0)
+                     + plistlib.dumps({"Notification": "com.norvale.lasd.NoUpdateRequired"}, fmt=plistlib.FMT_BINARY))
+    wait_for(lambda: 'notification "com.norvale.lasd.NoUpdateRequired"' in told(), "the notification")
+    run("systemctl", "stop", *units)
+    run("rm", *(target for _, target, _ in installed))
+    run("systemctl", "daemon-reload")
+    for folder in made:
+        os.rmdir(folder)
+
+
 def journal_explains():
     bvhelperctl("plist", "load", "/nowhere.plist", check=False)
     bvhelperctl("carrier", "remove", "/etc/passwd", check=False)
@@ -707,7 +739,7 @@ def purge():
 def main():
     steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, works_in_its_sandbox, works_for_the_whole_phone,
              asks_the_network, beats_over_the_cellular_link, held_in_its_sandbox,
-             other_accounts_are_told_apart, journal_explains, leaves_when_idle_and_comes_back,
+             other_accounts_are_told_apart, a_telephony_daemon_without_rights_lives_with_it, journal_explains, leaves_when_idle_and_comes_back,
              a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade, remove, purge]
     for step in steps:
         began = time.monotonic()

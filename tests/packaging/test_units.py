@@ -60,6 +60,17 @@ class Units(unittest.TestCase):
         named = {line.split(". ")[0] for line in self.text.splitlines() if line.startswith("# Open: ")}
         self.assertEqual(named, wanted)
 
+    def test_the_example_units_of_a_telephony_daemon_are_well_formed(self):
+        examples = SOURCE / "client" / "examples" / "brenvikd"
+        names = sorted(each.name for each in examples.iterdir() if each.suffix in (".service", ".socket"))
+        self.assertEqual(names, ["brenvikd-lasd.socket", "brenvikd.service", "brenvikd.socket"])
+        for name in names:
+            text = (examples / name).read_text().replace("ExecStart=/usr/libexec/brenvikd", "ExecStart=/bin/true")
+            (self.folder / name).write_text(text)
+        for name in names:
+            done = self.analyze("verify", "--man=no", name=name)
+            self.assertEqual((done.returncode, done.stderr), (0, ""), name)
+
 
 if __name__ == "__main__":
     unittest.main()

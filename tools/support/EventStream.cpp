@@ -112,13 +112,15 @@ int printEvents(const EventStreamOptions& given) {
     options.directory = created == BVMH_ERROR_NOT_HANDED_OVER ? bvmh_bootstrap_directory()
                                                               : "the sockets of the service manager";
   }
-  if (created == BVMH_ERROR_NOT_HANDED_OVER) {
+  const bool isHandedOver = created != BVMH_ERROR_NOT_HANDED_OVER;
+  if (!isHandedOver) {
     created = bvmh_listener_create(options.directory.c_str(), kBoth, &made);
   }
   const std::unique_ptr<bvmh_listener, FreeListener> listener(made);
   if (created != BVMH_OK) return cannotListen(options, created, errno);
   if (options.helperUid) bvmh_listener_allow_uid(listener.get(), *options.helperUid);
-  std::fprintf(stderr, "%s: listening in %s\n", options.program.c_str(), options.directory.c_str());
+  std::fprintf(stderr, "%s: listening %s %s\n", options.program.c_str(), isHandedOver ? "on" : "in",
+               options.directory.c_str());
 
   for (std::uint64_t count = 0; !options.most || count < *options.most;) {
     std::array inputs{pollfd{bvmh_listener_fd(listener.get()), POLLIN, 0}, pollfd{signals.get(), POLLIN, 0}};

@@ -12,8 +12,9 @@ namespace brenvik::tools {
 
 // How a stand-in for the telephony daemon behaves.
 struct EventStreamOptions {
-  std::string program;    // its name, for messages
-  std::string directory;  // of the two services; empty: the place compiled in
+  std::string program;  // its name, for messages
+  // Of the two services. Empty: the sockets that a service manager handed over, else the place compiled in.
+  std::string directory;
   bool asJson = false;
   bool answers = true;                // false: pushes are printed and never answered
   std::int32_t errorCode = 0;         // of the answers; 0: success
