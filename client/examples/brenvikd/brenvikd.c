@@ -2,8 +2,8 @@
 /* SPDX-FileCopyrightText: The BrenvikMobileHelper authors */
 
 /*
- * The smallest telephony daemon that lives with the helper: it takes over the sockets that the service manager made,
- * asks where the phone is, and prints what it is told. It runs under an account of its own.
+ * The smallest telephony daemon that lives with the helper: it takes over the sockets that the service
+ * manager made, asks where the phone is, and prints what it is told. It runs under an account of its own.
  *
  *   cc brenvikd.c -o brenvikd $(pkg-config --cflags --libs brenvik-mobile-helper)
  */
@@ -49,8 +49,8 @@ int main(void) {
   int32_t code = bvmh_listener_create_from_environment(BVMH_PUSHES | BVMH_NOTIFICATIONS, &listener);
   if (code != BVMH_OK) return fail("no sockets", code);
 
-  /* The channel stays open, because the helper leaves ten seconds after its last client. The question returns at once;
-   * its answer is a push. */
+  /* The channel stays open, because the helper leaves ten seconds after its last client. The question returns
+   * at once; its answer is a push. */
   bvmh_client* client = bvmh_client_create();
   if (client == NULL) return fail("no client", BVMH_ERROR_NO_MEMORY);
   code = bvmh_connect(client);
