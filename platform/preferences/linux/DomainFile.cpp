@@ -13,11 +13,12 @@
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
 #include <ctime>
 #include <thread>
 #include <utility>
 
+#include "platform/base/ErrorText.h"
+#include "platform/base/Rename.h"
 #include "platform/log/Log.h"
 #include "platform/plist/PropertyListCodec.h"
 
@@ -94,25 +95,7 @@ int writeAll(int file, std::span<const std::string_view> content) noexcept {
   return 0;
 }
 
-// Fails with EEXIST when the name is taken.
-int renameToFreeName(int folder, const char* from, const char* to) noexcept {
-  if (::renameat2(folder, from, folder, to, RENAME_NOREPLACE) == 0) return 0;
-  if (errno != EINVAL) return -1;
-  // A file system that knows no flags. The lock keeps other writers from taking the name meanwhile.
-  struct stat facts;
-  if (::fstatat(folder, to, &facts, AT_SYMLINK_NOFOLLOW) == 0) {
-    errno = EEXIST;
-    return -1;
-  }
-  return ::renameat(folder, from, folder, to);
-}
-
 }  // namespace
-
-const char* describeError(int error) noexcept {
-  const char* const text = ::strerrordesc_np(error);
-  return text != nullptr ? text : "unknown error";
-}
 
 int FolderLock::take(int folder, std::chrono::milliseconds patience) noexcept {
   const auto deadline = std::chrono::steady_clock::now() + patience;

@@ -17,9 +17,6 @@
 
 namespace brenvik {
 
-// An errno in words.
-const char* describeError(int error) noexcept;
-
 // Where a domain's file is, and what is made for it when it is missing.
 struct DomainPlace {
   std::string root;    // exists, or nothing can be stored

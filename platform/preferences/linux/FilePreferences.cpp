@@ -14,6 +14,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/base/ErrorText.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/preferences/linux/DomainFile.h"
