@@ -29,8 +29,8 @@ struct SqliteFunctions {
 #undef BRENVIK_SQLITE_MEMBER
 };
 
-// Bytes that SQLite may have at once, for all connections of the process: several times what a remap of a
-// million contacts takes. A statement that needs more fails with SQLITE_NOMEM.
+// Bytes that SQLite may have at once, for all connections of the process: ten times what a remap of 100,000
+// contacts takes. A statement that needs more fails with SQLITE_NOMEM.
 inline constexpr std::int64_t kMostSqliteMemory = std::int64_t{32} << 20;
 
 // The functions, all of them, for the life of the process; null where there is no usable library (asked
