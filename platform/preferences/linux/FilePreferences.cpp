@@ -43,8 +43,8 @@ std::string homeOfEffectiveUser(int* failure) {
   }
   if (error == 0 && found != nullptr && found->pw_dir != nullptr) return found->pw_dir;
   // A look-up that failed may say that there is no such account; errno keeps the truth.
+  if (error == ENOMEM || errno == ENOMEM) throw std::bad_alloc();
   *failure = error != 0 ? error : errno;
-  if (*failure == ENOMEM) throw std::bad_alloc();
   return {};
 }
 

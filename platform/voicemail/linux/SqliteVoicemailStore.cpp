@@ -51,7 +51,11 @@ UniqueFd enterDirectory(int parent, const char* name, mode_t mode, uid_t uid, gi
     (void)::unlinkat(parent, kFolderInTheMaking, AT_REMOVEDIR);  // the next attempt copes with what stays
     return {};
   }
-  if (::fsync(parent) != 0) return {};  // or a power cut takes the folder with the tokens in it
+  // Or a power cut takes the folder with the tokens in it. The next attempt makes it again.
+  if (::fsync(parent) != 0) {
+    (void)::unlinkat(parent, name, AT_REMOVEDIR);
+    return {};
+  }
   return fd;
 }
 

@@ -6,6 +6,7 @@
 #include <sched.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -16,12 +17,18 @@
 #include <string>
 #include <vector>
 
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/files/fakes/ChildProcesses.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/sqlite/fakes/ManualSqliteTime.h"
 #include "platform/voicemail/fakes/InMemoryVoicemailStore.h"
 #include "platform/voicemail/linux/DynamicVisualVoicemail.h"
+
+extern "C" int fsync(int file) {
+  if (brenvik::FailingCall::failsNow("fsync")) return -1;
+  return static_cast<int>(::syscall(SYS_fsync, file));
+}
 
 namespace brenvik {
 namespace {
@@ -270,6 +277,21 @@ TEST_F(SqliteVoicemailStoreTest, AnAnsweredChangeIsHeldFastInItsFolder) {
   ASSERT_FALSE(calls.empty());
   EXPECT_EQ(std::count(calls.begin(), calls.end(), "unlink"), 1);
   EXPECT_EQ(calls.back(), "open folder to sync it");
+}
+
+TEST_F(SqliteVoicemailStoreTest, AFolderThatCannotBeHeldFastIsNoPlaceForATokenAndIsMadeAgain) {
+  // Of the home, of the folder in it; then all is as usual.
+  for (const int earlier : {0, 1}) {
+    FailingCall fails("fsync", EIO, earlier);
+    RecordingLog log;
+    store.setToken(&token);
+    EXPECT_EQ(fails.failures(), 1);
+    EXPECT_EQ(log.entries(), std::vector{errorLine("The voicemail store could not be written")});
+    EXPECT_FALSE(isThere(home / "Library/Voicemail"));
+    std::filesystem::remove_all(home / "Library");
+  }
+  store.setToken(&token);
+  EXPECT_EQ(store.copyToken(), token);
 }
 
 TEST_F(SqliteVoicemailStoreTest, AnEndlessSearchIsCutOffAndTold) {
