@@ -365,6 +365,23 @@ TEST_F(LASDUpdaterTest, ServerEntriesOfAnEarlierCheckAreReplacedBeforeUse) {
       << "what counts is the record in the preferences, not what was seen of the server";
 }
 
+TEST_F(LASDUpdaterTest, ARecordThatAnotherProcessRemovedOrReplacedMeanwhileDecidesTheNextCheck) {
+  serveAll("1.0");
+  check(gsm);
+  ASSERT_TRUE(local("gsm"));
+  InMemoryPreferences another(preferences.disk());
+  const auto store = [&another](const PropertyList& value) {
+    another.setValue("gsm", value, "com.norvale.lasd", UserScope::currentUser, HostScope::anyHost);
+    return bool{another.synchronize("com.norvale.lasd", UserScope::currentUser, HostScope::anyHost)};
+  };
+  ASSERT_TRUE(store({}));
+  check(gsm);
+  ASSERT_TRUE(store(versionOnly("0.9")));
+  check(gsm);
+  EXPECT_EQ(notifications(), std::vector<std::string>(3, "UpdateAvailable gsm"));
+  EXPECT_TRUE(logged(info("We have gsm version 0.9, server has 1.0, update required")));
+}
+
 TEST_F(LASDUpdaterTest, AStalledDownloadHoldsTheProcessWithoutAnyClient) {
   serveAll("1.0");
   updater->checkForUpdate(server, gsm);

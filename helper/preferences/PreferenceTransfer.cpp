@@ -40,17 +40,16 @@ KernelReturn PreferenceTransfer::setPreferenceValue(PortName /*port*/, char* dom
   // One byte asks for removal and is not looked at; no property list is that short.
   if (valueLength != 1) {
     if (valueBytes == nullptr) return kern::failure;
-    CodecFailure why{};
-    value = parsePropertyList({static_cast<const std::byte*>(valueBytes), valueLength}, &why);
-    if (!value) return why == CodecFailure::noMemory ? kern::resourceShortage : kern::failure;
+    value = parsePropertyList({static_cast<const std::byte*>(valueBytes), valueLength});
+    if (!value) return kern::failure;
   }
   if (!preferences_.setValue(*keyText, value, *domainText, UserScope::currentUser, HostScope::anyHost)) {
-    return kern::resourceShortage;
+    return kern::failure;
   }
   // The status does not tell whether the disk took it; the store's own error line does.
   const Synchronized stored =
       preferences_.synchronize(*domainText, UserScope::currentUser, HostScope::anyHost);
-  return stored.lackedMemory() ? kern::resourceShortage : kern::success;
+  return stored.lackedMemory() ? kern::failure : kern::success;
 }
 
 KernelReturn PreferenceTransfer::copyPreferenceValue(PortName /*port*/, char* domain, char* key,
@@ -82,14 +81,11 @@ KernelReturn PreferenceTransfer::copyValue(Scope scope, char* domain, char* key,
         !preferences_.synchronize(*domainText, UserScope::currentUser, HostScope::anyHost).lackedMemory() &&
         preferences_.readValue(*keyText, *domainText, UserScope::currentUser, HostScope::anyHost, &value);
   }
-  if (!isKnown) return kern::resourceShortage;
+  if (!isKnown) return kern::failure;
   if (!value) return kern::success;
 
-  CodecFailure why{};
-  const auto bytes = serializePropertyList(value, PropertyListFormat::xml, &why);
-  if (!bytes || bytes->empty()) {
-    return why == CodecFailure::noMemory ? kern::resourceShortage : kern::failure;
-  }
+  const auto bytes = serializePropertyList(value, PropertyListFormat::xml);
+  if (!bytes || bytes->empty()) return kern::failure;
   const KernelReturn code = fillPayload(regions_, *bytes, payload);
   if (scope == Scope::application) {
     logBsd(SyslogPriority::error, "VM_ALLOCATE %ul (mhs2)\n", payload->length);

@@ -21,7 +21,8 @@ using DictionaryReader = std::function<PropertyList(const char* path)>;
 // Main loop only; keeps nothing between requests.
 //
 // Text arguments are the 256-byte fields of the request: each is ended by force at its last byte. `port` is
-// not looked at. The status is a kernel-style code; a payload is made only with success.
+// not looked at. The status is a kernel-style code: 5 also for a lack of memory, and the allocator's own code
+// where the region of a payload is refused. A payload is made only with success.
 class PreferenceTransfer {
  public:
   // The references outlive the object.

@@ -179,7 +179,7 @@ TEST_F(PreferenceTransferTest, AValueThatIsLostForWantOfMemoryIsNotSuccess) {
   ASSERT_EQ(set("com.example", "greeting", kXmlString), kern::success);
   for (const int operations : {0, 1}) {  // the setting, the storing
     preferences.operationsWithMemory = operations;
-    EXPECT_EQ(set("com.example", "greeting", "x"), kern::resourceShortage);
+    EXPECT_EQ(set("com.example", "greeting", "x"), kern::failure);
   }
   preferences.operationsWithMemory = -1;
   EXPECT_TRUE(stored("greeting"));
@@ -191,9 +191,9 @@ TEST_F(PreferenceTransferTest, AValueThatCannotBeReadForWantOfMemoryIsNotAMissin
   ASSERT_EQ(set("com.example", "greeting", kXmlString), kern::success);
   for (const int operations : {0, 1}) {  // seeing what others wrote, reading
     preferences.operationsWithMemory = operations;
-    EXPECT_EQ(copy("com.example", "greeting"), kern::resourceShortage);
+    EXPECT_EQ(copy("com.example", "greeting"), kern::failure);
     expectNoPayload();
-    EXPECT_EQ(copyApp("com.example", "greeting"), kern::resourceShortage);
+    EXPECT_EQ(copyApp("com.example", "greeting"), kern::failure);
     expectNoPayload();
   }
   EXPECT_TRUE(log.entries().empty());

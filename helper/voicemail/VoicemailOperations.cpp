@@ -25,18 +25,19 @@ void writeToken(const std::optional<std::string>& token, char* field) {
   field[token->copy(field, token->size())] = '\0';
 }
 
-// The routines' own boundary: nothing is thrown past it.
+// The routines' own boundary: nothing is thrown past it. A text that there is no memory for could not be
+// converted.
 template <typename Work>
 KernelReturn guarded(Work work) noexcept {
   try {
     return work();
   } catch (const std::exception&) {
-    return kern::resourceShortage;
+    return kern::failure;
   }
 }
 
-// What the store says, of its operations or of one of them.
-KernelReturn codeFor(bool hadMemory) noexcept { return hadMemory ? kern::success : kern::resourceShortage; }
+// The status of a routine that takes a text, for which the store had memory or not.
+KernelReturn codeFor(bool hadMemory) noexcept { return hadMemory ? kern::success : kern::failure; }
 
 }  // namespace
 
@@ -58,11 +59,15 @@ KernelReturn VoicemailOperations::setVoicemailTokenForKey(PortName, char* key, c
 }
 
 KernelReturn VoicemailOperations::clearVoicemailToken(PortName) noexcept {
-  return codeFor(store_.setToken(nullptr));
+  (void)store_.setToken(nullptr);  // the routine has one status; the store logs what it could not do
+  return kern::success;
 }
 
 KernelReturn VoicemailOperations::resetVoicemailStore(PortName) noexcept {
-  return codeFor(store_.setToken(nullptr) && store_.removeAllRecords());
+  // Each step by itself: when the first one fails, the records go all the same.
+  (void)store_.setToken(nullptr);
+  (void)store_.removeAllRecords();
+  return kern::success;
 }
 
 KernelReturn VoicemailOperations::copyVoicemailTokenForKey(PortName, char* key, char* token) noexcept {
@@ -70,7 +75,7 @@ KernelReturn VoicemailOperations::copyVoicemailTokenForKey(PortName, char* key, 
     const std::optional<std::string> keyText = textOf(key);
     if (!keyText) return kern::failure;
     std::optional<std::string> value;
-    if (!store_.readTokenForKey(*keyText, &value)) return kern::resourceShortage;
+    if (!store_.readTokenForKey(*keyText, &value)) return kern::failure;
     writeToken(value, token);
     return kern::success;
   });
@@ -78,7 +83,7 @@ KernelReturn VoicemailOperations::copyVoicemailTokenForKey(PortName, char* key, 
 
 KernelReturn VoicemailOperations::copyVoicemailToken(PortName, char* token) noexcept {
   std::optional<std::string> value;
-  if (!store_.readToken(&value)) return kern::resourceShortage;
+  (void)store_.readToken(&value);  // what cannot be read is absent, and the store logs it
   writeToken(value, token);
   return kern::success;
 }

@@ -14,7 +14,9 @@ namespace brenvik {
 
 // The requests that set, clear and read the tokens of the voicemail store. Keys and tokens are fields of
 // kField bytes; the last byte of a field of the request is overwritten with a NUL. Status 0, or 5 when a text
-// is not valid UTF-8; then the store is not called. The port is not used. Main thread; nothing throws.
+// is not valid UTF-8; then the store is not called. 5 as well from a routine that takes a text, when there is
+// no memory for it. What the store could not do is told by its log lines only. The port is not used. Main
+// thread; nothing throws.
 class VoicemailOperations {
  public:
   static constexpr std::size_t kField = 256;
@@ -26,7 +28,7 @@ class VoicemailOperations {
   KernelReturn setVoicemailToken(PortName port, char* token) noexcept;
   KernelReturn setVoicemailTokenForKey(PortName port, char* key, char* token) noexcept;
   KernelReturn clearVoicemailToken(PortName port) noexcept;
-  // The general token first, then the records.
+  // The general token first, then the records; the second also when the first failed.
   KernelReturn resetVoicemailStore(PortName port) noexcept;
 
   // Write the token and a NUL into the reply's field; an empty text when there is none or it does not fit.

@@ -45,20 +45,32 @@ TEST_F(VoicemailOperationsTest, ATokenThatWasNeverSetIsAnEmptyStringAndStatus0) 
   EXPECT_EQ(keyed.text(), "");
 }
 
-TEST_F(VoicemailOperationsTest, WithoutMemoryForTheStoreEveryTokenRoutineSaysSo) {
+TEST_F(VoicemailOperationsTest,
+       WithoutMemoryForTheStoreATextIsA5AndTheRoutinesWithoutOneHaveTheirOnlyStatus) {
   store.setTokenForKey("key", "value");
   store.exhausted = true;
-  Field token;
-  EXPECT_EQ(operations.setVoicemailToken(kPort, Field("t").data()), kern::resourceShortage);
-  EXPECT_EQ(operations.setVoicemailTokenForKey(kPort, Field("key").data(), Field("t").data()),
-            kern::resourceShortage);
-  EXPECT_EQ(operations.clearVoicemailToken(kPort), kern::resourceShortage);
-  EXPECT_EQ(operations.resetVoicemailStore(kPort), kern::resourceShortage);
-  EXPECT_EQ(operations.copyVoicemailToken(kPort, token.data()), kern::resourceShortage);
-  EXPECT_EQ(operations.copyVoicemailTokenForKey(kPort, Field("key").data(), token.data()),
-            kern::resourceShortage);
+  Field token("stale");
+  EXPECT_EQ(operations.setVoicemailToken(kPort, Field("t").data()), kern::failure);
+  EXPECT_EQ(operations.setVoicemailTokenForKey(kPort, Field("key").data(), Field("t").data()), kern::failure);
+  EXPECT_EQ(operations.copyVoicemailTokenForKey(kPort, Field("key").data(), token.data()), kern::failure);
+  EXPECT_EQ(operations.clearVoicemailToken(kPort), kern::success);
+  EXPECT_EQ(operations.resetVoicemailStore(kPort), kern::success);
+  EXPECT_EQ(operations.copyVoicemailToken(kPort, token.data()), kern::success);
+  EXPECT_EQ(token.text(), "");
   store.exhausted = false;
   EXPECT_EQ(store.copyTokenForKey("key"), "value");
+}
+
+TEST_F(VoicemailOperationsTest, AResetWhoseFirstStepFailsStillRemovesTheRecords) {
+  const std::string general = "general";
+  store.setToken(&general);
+  store.setTokenForKey("key", "value");
+  store.calls.clear();
+  store.failures = 1;
+  EXPECT_EQ(operations.resetVoicemailStore(kPort), kern::success);
+  EXPECT_EQ(store.calls, (std::vector<std::string>{"clearToken", "removeAllRecords"}));
+  EXPECT_EQ(store.copyToken(), general);
+  EXPECT_EQ(store.copyTokenForKey("key"), std::nullopt);
 }
 
 TEST_F(VoicemailOperationsTest, TokensThatWereSetAreCopied) {

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "platform/plist/Document.h"
+#include "platform/plist/Text.h"
 #include "platform/plist/XmlSize.h"
 
 namespace brenvik::plist {
@@ -38,47 +39,6 @@ std::uint64_t loadBig(const unsigned char* bytes, std::size_t width) noexcept {
       return value;
     }
   }
-}
-
-bool isAscii(const char* bytes, std::size_t size) noexcept {
-  std::uint64_t all = 0;
-  for (; size >= 8; size -= 8, bytes += 8) {
-    std::uint64_t word;
-    std::memcpy(&word, bytes, sizeof word);
-    all |= word;
-  }
-  for (; size != 0; --size, ++bytes) all |= static_cast<unsigned char>(*bytes);
-  return (all & 0x8080808080808080ULL) == 0;
-}
-
-// Returns the end of what was written, at most three bytes a unit, or null at an unpaired surrogate.
-char* utf8FromUtf16(const unsigned char* from, std::size_t units, char* to) noexcept {
-  auto put = [&to](std::uint32_t byte) { *to++ = static_cast<char>(byte); };
-  for (std::size_t i = 0; i < units; ++i) {
-    std::uint32_t c = std::uint32_t{from[2 * i]} << 8 | from[2 * i + 1];
-    if (c < 0x80) {
-      put(c);
-      continue;
-    }
-    if (c < 0x800) {
-      put(0xC0 | c >> 6);
-      put(0x80 | (c & 0x3F));
-      continue;
-    }
-    if (c >= 0xD800 && c <= 0xDFFF) {
-      if (c >= 0xDC00 || ++i == units) return nullptr;
-      const std::uint32_t low = std::uint32_t{from[2 * i]} << 8 | from[2 * i + 1];
-      if (low < 0xDC00 || low > 0xDFFF) return nullptr;
-      c = 0x10000 + ((c & 0x3FF) << 10 | (low & 0x3FF));
-      put(0xF0 | c >> 18);
-      put(0x80 | (c >> 12 & 0x3F));
-    } else {
-      put(0xE0 | c >> 12);
-    }
-    put(0x80 | (c >> 6 & 0x3F));
-    put(0x80 | (c & 0x3F));
-  }
-  return to;
 }
 
 class Reader {
@@ -196,7 +156,7 @@ bool Reader::readText(unsigned char marker, const unsigned char* at, std::size_t
   std::size_t size = count;
   if (marker == 0x60) {
     char* const to = document_->allocateText(count * 3);
-    char* const stop = utf8FromUtf16(at, count, to);
+    char* const stop = utf8FromUtf16<ByteOrder::big>(at, count, to);
     document_->trim(stop == nullptr ? to : stop);
     if (stop == nullptr) return false;
     node.text = to;

@@ -216,6 +216,79 @@ TEST(XmlReaderTest, RefusesWhatIsWrongAroundTheValue) {
   }
 }
 
+// The text in UTF-16, its bytes in this order, without a mark. ASCII and U+1F600 only.
+std::string utf16(std::string_view text, bool isBigEndian) {
+  std::string bytes;
+  const auto add = [&](unsigned unit) {
+    const char high = static_cast<char>(unit >> 8);
+    const char low = static_cast<char>(unit);
+    bytes += isBigEndian ? high : low;
+    bytes += isBigEndian ? low : high;
+  };
+  for (std::size_t i = 0; i < text.size(); ++i) {
+    if (text[i] != '\xF0') {
+      add(static_cast<unsigned char>(text[i]));
+      continue;
+    }
+    add(0xD83D);
+    add(0xDE00);
+    i += 3;
+  }
+  return bytes;
+}
+
+TEST(XmlReaderTest, ReadsUtf16WithItsMarkWhateverItsByteOrder) {
+  const std::string smile = "\xF0\x9F\x98\x80";
+  for (const bool isBigEndian : {true, false}) {
+    const std::string mark = isBigEndian ? "\xFE\xFF" : "\xFF\xFE";
+    for (const char* declaration :
+         {"", "<?xml version='1.0'?>", "<?xml version='1.0' encoding='UTF-16'?>\r\n",
+          "<?xml version='1.0' encoding='utf-16' standalone='yes'?>"}) {
+      const std::string document =
+          declaration + ("<plist><dict><key>a</key><string>x&amp;" + smile + "\r\n</string></dict></plist>");
+      EXPECT_EQ(parse(mark + utf16(document, isBigEndian)).find("a").asString(), "x&" + smile + "\n")
+          << declaration;
+      EXPECT_FALSE(parse(utf16(document, isBigEndian))) << "without a mark it could be anything";
+      EXPECT_FALSE(parse(mark + mark + utf16(document, isBigEndian)));
+      EXPECT_FALSE(parse(mark + utf16(document, isBigEndian) + "\n")) << "half a character";
+      EXPECT_FALSE(parse(mark + utf16(document, !isBigEndian)));
+    }
+    for (const char* name :
+         {"UTF-8", "US-ASCII", "UTF-16LE", "UTF-16BE", "UTF-1", "UTF-160", "ISO-8859-1", ""}) {
+      EXPECT_FALSE(parse(
+          mark + utf16(std::string("<?xml version='1.0' encoding='") + name + "'?><plist><true/></plist>",
+                       isBigEndian)))
+          << name;
+    }
+    const std::string around[] = {utf16("<plist><string>", isBigEndian),
+                                  utf16("</string></plist>", isBigEndian)};
+    const auto withUnits = [&](std::string_view units) {
+      std::string text(units);
+      for (std::size_t i = 0; !isBigEndian && i < text.size(); i += 2) std::swap(text[i], text[i + 1]);
+      return parse(mark + around[0] + text + around[1]);
+    };
+    using namespace std::string_view_literals;
+    EXPECT_EQ(withUnits("\x20\xAC"sv).asString(), "\xE2\x82\xAC");
+    EXPECT_EQ(withUnits("\xFE\xFF"sv).asString(), "\xEF\xBB\xBF") << "inside a text it is a character";
+    for (const std::string_view bad : {"\xD8\x3D"sv, "\xDE\x00"sv, "\xD8\x3D\x00a"sv, "\xDE\x00\xD8\x3D"sv,
+                                       "\xFF\xFE"sv, "\x00\x00"sv, "\x00\x01"sv}) {
+      EXPECT_FALSE(withUnits(bad));
+    }
+    EXPECT_FALSE(parse(mark));
+    EXPECT_FALSE(parse(mark.substr(0, 1)));
+  }
+}
+
+TEST(XmlReaderTest, ReadsWhatDeclaresUsAsciiAndIsIt) {
+  for (const char* name : {"US-ASCII", "us-ascii"}) {
+    const std::string declaration = std::string("<?xml version='1.0' encoding='") + name + "'?>";
+    EXPECT_EQ(parse(declaration + "<plist><string>a&#233;</string></plist>").asString(), "a\xC3\xA9");
+    EXPECT_FALSE(parse(declaration + "<plist><string>\xC3\xA9</string></plist>"));
+    EXPECT_FALSE(parse(declaration + "<plist><true/></plist><!-- \xC3\xA9 -->"));
+  }
+  EXPECT_FALSE(parse("<?xml version='1.0' encoding='ASCII'?><plist><true/></plist>"));
+}
+
 TEST(XmlReaderTest, RefusesEveryEntityButThePredefinedAndAnyInternalDocumentType) {
   EXPECT_FALSE(parse("<!DOCTYPE plist []><plist><true/></plist>"));
   EXPECT_FALSE(parse("<!DOCTYPE plist [<!ENTITY a \"b\">]><plist><string>&a;</string></plist>"));

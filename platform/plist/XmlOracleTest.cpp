@@ -61,6 +61,8 @@ std::string randomDocument(std::mt19937& random) {
                                                 "\xEF\xBB\xBF",
                                                 "<?xml version=\"1.0\"?>",
                                                 "<?xml version='1.0' encoding='utf-8' standalone='no' ?>\n",
+                                                "<?xml version='1.0' encoding='US-ASCII'?>",
+                                                "<?xml version='1.0' encoding='UTF-16'?>",
                                                 " ",
                                                 "<!-- c -->",
                                                 "<?p i?>",
@@ -149,6 +151,40 @@ std::string mutated(const std::string& document, std::mt19937& random) {
   return changed;
 }
 
+// The document in UTF-16 with its mark; what is no UTF-8 in it becomes halves of pairs.
+std::string asUtf16(const std::string& document, bool isBigEndian) {
+  std::string bytes;
+  const auto add = [&](unsigned unit) {
+    bytes += static_cast<char>(isBigEndian ? unit >> 8 : unit);
+    bytes += static_cast<char>(isBigEndian ? unit : unit >> 8);
+  };
+  add(0xFEFF);
+  for (std::size_t i = 0; i < document.size();) {
+    const auto lead = static_cast<unsigned char>(document[i]);
+    const std::size_t length = lead < 0x80 ? 1 : lead < 0xE0 ? 2 : lead < 0xF0 ? 3 : 4;
+    unsigned c = length == 1 ? lead : lead & (0x7FU >> length);
+    bool isWhole = i + length <= document.size() && (lead < 0x80 || lead >= 0xC0);
+    for (std::size_t at = i + 1; isWhole && at < i + length; ++at) {
+      const auto next = static_cast<unsigned char>(document[at]);
+      isWhole = (next & 0xC0) == 0x80;
+      c = c << 6 | (next & 0x3F);
+    }
+    if (!isWhole) {
+      add(lead % 2 == 0 ? 0xD83D : 0xDE00);
+      ++i;
+      continue;
+    }
+    i += length;
+    if (c >= 0x10000) {
+      add(0xD800 | ((c - 0x10000) >> 10 & 0x3FF));
+      add(0xDC00 | (c & 0x3FF));
+    } else {
+      add(c);
+    }
+  }
+  return bytes;
+}
+
 struct Tally {
   int taken = 0;
   int refused = 0;
@@ -175,6 +211,20 @@ TEST(XmlOracleTest, WhatIsTakenOfRandomMarkupIsWellFormedAndHasTheSameTexts) {
   std::mt19937 random(1);
   Tally tally;
   for (int i = 0; i < 60000 && !HasFatalFailure(); ++i) compare(randomDocument(random), tally);
+  EXPECT_GT(tally.taken, 1000);
+  EXPECT_GT(tally.refused, 1000);
+}
+
+TEST(XmlOracleTest, WhatIsTakenOfRandomMarkupInUtf16IsWellFormedAndHasTheSameTexts) {
+  std::mt19937 random(4);
+  Tally tally;
+  for (int i = 0; i < 60000 && !HasFatalFailure(); ++i) {
+    std::string document = asUtf16(randomDocument(random), i % 2 == 0);
+    // Now and then a bit turned, a byte lost.
+    if (i % 5 == 0) document[random() % document.size()] ^= static_cast<char>(1U << random() % 8);
+    if (i % 7 == 0) document.erase(random() % document.size(), 1 + random() % 2);
+    compare(document, tally);
+  }
   EXPECT_GT(tally.taken, 1000);
   EXPECT_GT(tally.refused, 1000);
 }

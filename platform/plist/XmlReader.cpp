@@ -6,12 +6,15 @@
 #include <array>
 #include <charconv>
 #include <cstring>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include "platform/base/Utf8.h"
 #include "platform/plist/Calendar.h"
 #include "platform/plist/Document.h"
+#include "platform/plist/Text.h"
+#include "platform/plist/XmlEncoding.h"
 #include "platform/plist/XmlSize.h"
 
 namespace brenvik::plist {
@@ -248,8 +251,10 @@ const char* endOfPlainText(const char* at, const char* end) noexcept {
 
 class Reader {
  public:
-  explicit Reader(std::string_view bytes)
-      : begin_(bytes.data()),
+  // The bytes are UTF-8; `encoding` is what the document came in.
+  Reader(std::string_view bytes, XmlEncoding encoding)
+      : encoding_(encoding),
+        begin_(bytes.data()),
         cursor_(begin_),
         end_(begin_ + bytes.size()),
         document_(std::min(bytes.size() + 64, kFirstBlock)) {}
@@ -308,6 +313,7 @@ class Reader {
   bool dataNode(std::string_view text, Node& node);
   bool fits(const Node& root) const;
 
+  const XmlEncoding encoding_;
   const char* begin_;
   const char* cursor_;
   const char* end_;
@@ -349,13 +355,8 @@ bool Reader::declaration() {
   if (!pseudoAttribute("version", value) || value != "1.0") return false;
   bool spaced = space();
   if (spaced && cursor_ != end_ && *cursor_ == 'e') {
-    constexpr std::string_view kEncoding = "UTF-8";
-    if (!pseudoAttribute("encoding", value) || value.size() != kEncoding.size()) return false;
-    for (std::size_t i = 0; i < kEncoding.size(); ++i) {
-      const char upper =
-          value[i] >= 'a' && value[i] <= 'z' ? static_cast<char>(value[i] - 'a' + 'A') : value[i];
-      if (upper != kEncoding[i]) return false;
-    }
+    if (!pseudoAttribute("encoding", value) || !mayDeclare(encoding_, value)) return false;
+    if (isUsAscii(value) && !isAscii(cursor_, left())) return false;
     spaced = space();
   }
   if (spaced && cursor_ != end_ && *cursor_ == 's') {
@@ -702,7 +703,7 @@ bool Reader::fits(const Node& root) const {
 }
 
 PropertyList Reader::read() {
-  take("\xEF\xBB\xBF");
+  if (encoding_ == XmlEncoding::utf8) take("\xEF\xBB\xBF");  // else the mark has gone already
   if (!declaration() || !misc() || !documentType() || !misc() || !rootTag()) return {};
   if (!content() || !misc() || !endTag("plist") || !misc() || cursor_ != end_) return {};
   const Node root = nodes_.front();
@@ -714,8 +715,16 @@ PropertyList Reader::read() {
 }  // namespace
 
 PropertyList readXml(std::string_view bytes) {
-  if (bytes.size() > kLargestXmlForm || !hasOnlyXmlCharacters(bytes)) return {};
-  return Reader(bytes).read();
+  if (bytes.size() > kLargestXmlForm) return {};
+  const XmlEncoding encoding = encodingOf(bytes);
+  std::optional<std::string> converted;
+  if (encoding == XmlEncoding::utf16) {
+    converted = utf8OfUtf16(bytes);
+    if (!converted || converted->size() > kLargestXmlForm) return {};
+    bytes = *converted;
+  }
+  if (!hasOnlyXmlCharacters(bytes)) return {};
+  return Reader(bytes, encoding).read();
 }
 
 }  // namespace brenvik::plist

@@ -51,9 +51,10 @@ class Synchronized {
 
 // The platform's preferences: values by domain, key, user scope and host scope. Any thread. Texts are UTF-8.
 //
-// A set value is seen by this process at once and by other processes after synchronize(), which also takes
-// over what they have written. A domain that names no file reads as having no values; setting a value there
-// stores nothing and logs an error. Nothing is thrown: each operation tells whether memory sufficed.
+// A set value is seen by this process at once and by other processes after synchronize(). What others have
+// stored, replaced or removed is seen by every read. A domain that names no file, or whose folder is not
+// known at the moment, reads as having no values; setting a value there stores nothing and logs an error.
+// Nothing is thrown: each operation tells whether memory sufficed.
 class PreferencesStore {
  public:
   virtual ~PreferencesStore() = default;
@@ -67,8 +68,8 @@ class PreferencesStore {
   // is read is what is stored. Not whole, too, for a domain that names no file.
   virtual Synchronized synchronize(std::string_view domain, UserScope user, HostScope host) noexcept = 0;
 
-  // The key's value in exactly this scope, or none, in *value. False when memory ran out, and it is not
-  // known.
+  // The key's value in exactly this scope, or none, in *value: what was set here and not synchronized yet,
+  // else what is stored now. False when memory ran out, and it is not known.
   virtual bool readValue(std::string_view key, std::string_view domain, UserScope user, HostScope host,
                          PropertyList* value) noexcept = 0;
 

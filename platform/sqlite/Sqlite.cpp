@@ -3,6 +3,7 @@
 #include "platform/sqlite/Sqlite.h"
 
 #include <dlfcn.h>
+#include <fcntl.h>
 
 #include <mutex>
 
@@ -19,6 +20,20 @@ bool look(void* library, const char* name, Function* function) noexcept {
   return *function != nullptr;
 }
 
+// A pipe may stand where a journal belongs, and opening one for reading waits for a writer. For regular files
+// the flag means nothing.
+int openWithoutWaiting(const char* path, int flags, int mode) noexcept {
+  return ::open(path, flags | O_NONBLOCK, mode);
+}
+
+bool limit(const SqliteFunctions& functions) noexcept {
+  (void)functions.hard_heap_limit64(kMostSqliteMemory);
+  sqlite3_vfs* const files = functions.vfs_find(nullptr);
+  return files != nullptr && files->iVersion >= 3 &&
+         files->xSetSystemCall(files, "open", reinterpret_cast<sqlite3_syscall_ptr>(&openWithoutWaiting)) ==
+             SQLITE_OK;
+}
+
 bool load(SqliteFunctions* functions, bool* lackedMemory) noexcept {
   void* const library = ::dlopen(kLibrary, RTLD_NOW | RTLD_LOCAL);
   if (library == nullptr) {
@@ -26,8 +41,9 @@ bool load(SqliteFunctions* functions, bool* lackedMemory) noexcept {
     return false;
   }
 #define BRENVIK_SQLITE_LOOK(name) &&look(library, "sqlite3_" #name, &functions->name)
-  return true BRENVIK_SQLITE_FUNCTIONS(BRENVIK_SQLITE_LOOK);
+  const bool isWhole = true BRENVIK_SQLITE_FUNCTIONS(BRENVIK_SQLITE_LOOK);
 #undef BRENVIK_SQLITE_LOOK
+  return isWhole && limit(*functions);
 }
 
 }  // namespace

@@ -4,6 +4,7 @@
 
 #include <sqlite3.h>
 
+#include <cstdint>
 #include <memory>
 
 namespace brenvik {
@@ -15,12 +16,12 @@ namespace brenvik {
 struct SqliteFunctions {
 // clang-format off
 #define BRENVIK_SQLITE_FUNCTIONS(each) \
-  each(bind_blob) each(bind_double) each(bind_int64) each(bind_null) each(bind_text) each(busy_timeout) \
+  each(bind_blob) each(bind_double) each(bind_int64) each(bind_null) each(bind_text) each(busy_handler) \
   each(changes) each(clear_bindings) each(close_v2) each(column_blob) each(column_bytes) each(column_count) \
   each(column_double) each(column_int64) each(column_text) each(column_type) each(db_config) each(errmsg) \
   each(errstr) each(exec) each(extended_errcode) each(extended_result_codes) each(finalize) each(free) \
-  each(get_autocommit) each(last_insert_rowid) each(limit) each(open_v2) each(prepare_v3) \
-  each(progress_handler) each(reset) each(step) each(total_changes)
+  each(get_autocommit) each(hard_heap_limit64) each(last_insert_rowid) each(limit) each(memory_highwater) each(open_v2) each(prepare_v3) \
+  each(progress_handler) each(reset) each(step) each(total_changes) each(vfs_find)
 // clang-format on
 // NOLINTNEXTLINE(bugprone-macro-parentheses): a member's name cannot have them
 #define BRENVIK_SQLITE_MEMBER(name) decltype(&::sqlite3_##name) name = nullptr;
@@ -28,8 +29,14 @@ struct SqliteFunctions {
 #undef BRENVIK_SQLITE_MEMBER
 };
 
+// Bytes that SQLite may have at once, for all connections of the process: ten times what a remap of 100,000
+// contacts takes. A statement that needs more fails with SQLITE_NOMEM.
+inline constexpr std::int64_t kMostSqliteMemory = std::int64_t{32} << 20;
+
 // The functions, all of them, for the life of the process; null where there is no usable library (asked
 // again, it looks again), or where *lackedMemory, if given, says so, none could be loaded now. Any thread.
+// The library has kMostSqliteMemory, and opens files without waiting for whoever is at the other end of a
+// pipe.
 const SqliteFunctions* sqlite(bool* lackedMemory = nullptr) noexcept;
 
 // Whether a result of SQLite, plain or extended, is for want of memory.

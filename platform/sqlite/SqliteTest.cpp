@@ -2,14 +2,21 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/sqlite/Sqlite.h"
 
+#include <dlfcn.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <fstream>
 #include <string>
 
+#include "platform/sqlite/ForeignDatabase.h"
+#include "platform/sqlite/fakes/ManualSqliteTime.h"
+
 namespace brenvik {
 namespace {
+
+using namespace std::chrono_literals;
 
 bool isMapped() {
   std::ifstream maps("/proc/self/maps");
@@ -46,6 +53,82 @@ TEST(SqliteTest, EveryFunctionIsThereAndTheFirstOnesWork) {
   const SqliteStatement statement(prepared);
   ASSERT_EQ(functions->step(prepared), SQLITE_ROW);
   EXPECT_EQ(functions->column_int64(prepared, 0), 42);
+}
+
+class ForeignDatabaseTest : public testing::Test {
+ protected:
+  static SqliteDatabase open(const std::string& path) {
+    sqlite3* opened = nullptr;
+    EXPECT_EQ(sqlite()->open_v2(path.c_str(), &opened, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr),
+              SQLITE_OK);
+    return SqliteDatabase(opened);
+  }
+  // "done", or why not.
+  static std::string run(const SqliteDatabase& database, const char* statements) {
+    const int code = sqlite()->exec(database.get(), statements, nullptr, nullptr, nullptr);
+    return code == SQLITE_OK ? "done" : sqlite()->errmsg(database.get());
+  }
+
+  static constexpr const char kEndless[] =
+      "WITH RECURSIVE n(i) AS (SELECT 1 UNION ALL SELECT i + 1 FROM n) SELECT count(*) FROM n";
+  ManualSqliteTime time;
+  SqliteDatabase database = open(":memory:");
+};
+
+TEST_F(ForeignDatabaseTest, AnEndlessStatementEndsWithTheTimeLimitAndOnlyIfItApplies) {
+  time.perLook = 1ms;
+  SqliteTimeLimit limit(1s, time.asTime());
+  limit.applyTo(database.get());
+  EXPECT_EQ(run(database, kEndless), "interrupted");
+  EXPECT_GT(time.now, 1s);
+  EXPECT_LT(time.now, 1s + 10ms);
+  EXPECT_TRUE(limit.isOver());
+  // All statements share the one limit.
+  EXPECT_EQ(run(database, kEndless), "interrupted");
+  EXPECT_LT(time.now, 1s + 20ms);
+  SqliteTimeLimit::lift(database.get());
+  EXPECT_EQ(run(database,
+                "WITH RECURSIVE n(i) AS (SELECT 1 UNION ALL SELECT i + 1 FROM n LIMIT 1000) "
+                "SELECT count(*) FROM n"),
+            "done");
+}
+
+TEST_F(ForeignDatabaseTest, LooksAtTheClockAreCloseTogether) {
+  SqliteTimeLimit limit(1h, {[this] { return ++time.now; }, {}});
+  limit.applyTo(database.get());
+  EXPECT_EQ(run(database,
+                "WITH RECURSIVE n(i) AS (SELECT 1 UNION ALL SELECT i + 1 FROM n LIMIT 1000) "
+                "SELECT hex(zeroblob(i)) FROM n"),
+            "done");
+  EXPECT_GT(time.now.count(), 100) << "several instructions a row";
+}
+
+TEST_F(ForeignDatabaseTest, WhatIsTakenFromASchemaIsNotTrustedAndLongTextsAreNotMade) {
+  using CreateFunction = decltype(&::sqlite3_create_function);
+  void* const library = ::dlopen("libsqlite3.so.0", RTLD_NOW | RTLD_NOLOAD);
+  ASSERT_NE(library, nullptr);
+  const auto create = reinterpret_cast<CreateFunction>(::dlsym(library, "sqlite3_create_function"));
+  ASSERT_NE(create, nullptr);
+  static int calls = 0;
+  ASSERT_EQ(create(
+                database.get(), "application", 0, SQLITE_UTF8, nullptr,
+                [](sqlite3_context*, int, sqlite3_value**) { ++calls; }, nullptr, nullptr),
+            SQLITE_OK);
+  ASSERT_EQ(run(database, "CREATE VIEW v AS SELECT application()"), "done");
+  EXPECT_EQ(run(database, "SELECT * FROM v; SELECT length(zeroblob(70000))"), "done");
+  EXPECT_EQ(calls, 1) << "so it is up to the connection";
+  distrustDatabase(database.get());
+  EXPECT_EQ(run(database, "SELECT * FROM v"), "unsafe use of application()");
+  EXPECT_EQ(run(database, "SELECT application()"), "done");
+  EXPECT_EQ(calls, 2);
+  EXPECT_EQ(run(database, "SELECT length(zeroblob(70000))"), "string or blob too big");
+  EXPECT_EQ(run(database, "ATTACH ':memory:' AS other"), "too many attached databases - max 0");
+  (void)::dlclose(library);
+}
+
+TEST(SqliteTest, TheMemoryOfAllDatabasesIsLimited) {
+  ASSERT_NE(sqlite(), nullptr);
+  EXPECT_EQ(sqlite()->hard_heap_limit64(-1), kMostSqliteMemory);
 }
 
 }  // namespace

@@ -8,11 +8,11 @@
 namespace brenvik {
 
 // The voicemail store's access tokens: one general token, and further tokens by key. Texts are UTF-8 without
-// NUL. Main thread; waits for another process that holds the store for about a second at most. Reports no
-// failure of the store: one that cannot be opened has no tokens, and what cannot be written is dropped. What
-// a setter stored before it returned survives a crash and a power cut. Throws nothing; each operation returns
-// false when this process ran out of memory, and then nothing is known of the store, or nothing changed
-// there.
+// NUL. Main thread; an operation waits for other processes and runs what they have put into the store for a
+// second at most. A failure of the store is logged and not reported: one that cannot be opened has no tokens,
+// and what cannot be written is dropped. What a setter stored before it returned survives a crash and a power
+// cut. Throws nothing; each operation returns false when this process ran out of memory, and then nothing is
+// known of the store, or nothing changed there.
 class VoicemailStore {
  public:
   virtual ~VoicemailStore() = default;

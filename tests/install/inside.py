@@ -488,6 +488,34 @@ def beats_over_the_cellular_link():
         expect_equal(other.echo_requests(), [], "by the other interface")
 
 
+def stores_no_preference_where_it_would_be_lost():
+    """Without its folder, what the helper sees of the home is empty and read-only."""
+    folder = pathlib.Path("/root/Library")
+    run("systemctl", "stop", SERVICE)
+    folder.rename("/root/Library.away")
+    try:
+        bvhelperctl("prefs", "set", "com.example.lost", "text", "lost")
+        run("journalctl", "--sync")
+        expect("Preferences /root/Library/Preferences/com.example.lost.plist: mkdir: Read-only file system"
+               in log_of_the_helper(), "a line says that it was not stored")
+        expect("lost" not in bvhelperctl("prefs", "get", "com.example.lost", "text", check=False).stdout,
+               "it is not there")
+        expect(not folder.exists(), "nothing was made in the real home either")
+        run("systemctl", "stop", SERVICE)
+    finally:
+        pathlib.Path("/root/Library.away").rename(folder)
+    # Without any folder there, what makes the system's folders makes it again.
+    folder.rename("/root/Library.away")
+    run("systemd-tmpfiles", "--create", "--prefix=/root")
+    expect_equal(stat.S_IMODE(os.stat(folder / "Preferences").st_mode), 0o700, "mode of the folder that is made")
+    (folder / "Preferences").rmdir()
+    folder.rmdir()
+    pathlib.Path("/root/Library.away").rename(folder)
+    bvhelperctl("prefs", "set", "com.example.kept", "text", "kept")
+    run("systemctl", "stop", SERVICE)
+    expect_equal(bvhelperctl("prefs", "get", "com.example.kept", "text").stdout, "kept\n", "after another start")
+
+
 def held_in_its_sandbox():
     before = pathlib.Path("/etc/hostname").read_bytes() if os.path.exists("/etc/hostname") else None
     expect_equal(bvhelperctl("carrier", "create-link", "/x", "/etc/hostname", check=False).returncode, 1)
@@ -737,7 +765,8 @@ def purge():
 
 
 def main():
-    steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, works_in_its_sandbox, works_for_the_whole_phone,
+    steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, works_in_its_sandbox,
+             stores_no_preference_where_it_would_be_lost, works_for_the_whole_phone,
              asks_the_network, beats_over_the_cellular_link, held_in_its_sandbox,
              other_accounts_are_told_apart, a_telephony_daemon_without_rights_lives_with_it, journal_explains, leaves_when_idle_and_comes_back,
              a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade, remove, purge]

@@ -52,6 +52,23 @@ class Units(unittest.TestCase):
         done = self.analyze("security", "--offline=true", "--threshold=25", "--no-pager", name="weaker.service")
         self.assertNotEqual(done.returncode, 0)
 
+    def values(self, key):
+        """The words of all lines of the service unit with this key."""
+        return [word for line in self.text.splitlines() if line.startswith(f"{key}=")
+                for word in line.split("=", 1)[1].split()]
+
+    def test_nothing_can_be_stored_in_the_place_of_the_homes_it_hides(self):
+        self.assertEqual(self.values("ProtectHome"), ["tmpfs"])
+        self.assertEqual(sorted(self.values("TemporaryFileSystem")), ["/home:ro", "/root:ro", "/run/user:ro"])
+
+    def test_the_folder_of_its_preferences_is_made_before_it_starts(self):
+        made = {line.split()[1] for line in (BUILD / "units" / "brenvik.tmpfiles").read_text().splitlines()
+                if line.startswith("d ")}
+        for path in self.values("BindPaths"):
+            self.assertIn(path.lstrip("-"), made)
+        self.assertIn("/root/Library/Preferences", made)
+        self.assertIn("systemd-tmpfiles-setup.service", self.values("After"))
+
     def test_every_open_point_is_named_with_its_weight(self):
         done = self.analyze("security", "--offline=true", "--json=short", "--no-pager")
         items = json.loads(done.stdout)

@@ -11,24 +11,20 @@
 #include <utility>
 
 #include "platform/base/Utf8.h"
-#include "platform/sqlite/Sqlite.h"
+#include "platform/sqlite/ForeignDatabase.h"
 
 namespace brenvik {
 namespace {
 
 constexpr char kBelowHome[] = "/Library/AddressBook/contacts.db";
 
-constexpr int kStepsBetweenLooks = 20000;  // at the clock, in instructions of SQLite: a millisecond or so
-
-using Clock = std::chrono::steady_clock;
-
-int isPast(void* deadline) { return Clock::now() > *static_cast<const Clock::time_point*>(deadline) ? 1 : 0; }
-
 class SqliteChannelManager final : public ContactsChannelManager {
  public:
-  SqliteChannelManager(SqliteDatabase database, std::chrono::milliseconds patience,
-                       std::chrono::milliseconds longestRemap) noexcept
-      : database_(std::move(database)), patience_(patience), longestRemap_(longestRemap) {}
+  SqliteChannelManager(std::chrono::milliseconds patience, SqliteTime time)
+      : limit_(patience, std::move(time)) {}
+
+  // False when there is no database; throws std::bad_alloc when there may be one.
+  bool open(const std::string& path);
 
   bool remapChannelIdentifier(std::string_view from, std::string_view to,
                               std::optional<std::string>* error) noexcept override {
@@ -38,14 +34,12 @@ class SqliteChannelManager final : public ContactsChannelManager {
         return false;
       }
       const SqliteFunctions& sql = *sqlite();
-      Clock::time_point deadline = Clock::now() + patience_ + longestRemap_;
-      (void)sql.busy_timeout(database_.get(), static_cast<int>(patience_.count()));
-      sql.progress_handler(database_.get(), kStepsBetweenLooks, &isPast, &deadline);
       const bool done = remap(from, to);
       // The description goes with the first failure, so it is taken before the transaction is given up.
       if (!done) *error = sql.errmsg(database_.get());
-      sql.progress_handler(database_.get(), 0, nullptr, nullptr);
+      SqliteTimeLimit::lift(database_.get());
       if (sql.get_autocommit(database_.get()) == 0) (void)run("ROLLBACK");
+      limit_.applyTo(database_.get());
       return done;
     } catch (const std::bad_alloc&) {
       // Closing the connection gives up what is unfinished. The error stays absent: it needs memory, too.
@@ -81,9 +75,8 @@ class SqliteChannelManager final : public ContactsChannelManager {
            SQLITE_OK;
   }
 
-  const SqliteDatabase database_;
-  const std::chrono::milliseconds patience_;
-  const std::chrono::milliseconds longestRemap_;
+  SqliteTimeLimit limit_;
+  SqliteDatabase database_;
 };
 
 struct Free {
@@ -114,33 +107,32 @@ bool isHopeless(int result) noexcept {
   }
 }
 
-// Null when there is no database; throws std::bad_alloc when there may be one.
-SqliteDatabase open(const std::string& path) {
+bool SqliteChannelManager::open(const std::string& path) {
   struct stat status {};
-  if (path.empty() || ::lstat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) return nullptr;
+  if (path.empty() || ::lstat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) return false;
   // The permission bits say what the owner wants; root obeys them, too.
-  if ((status.st_mode & (S_IRUSR | S_IRGRP | S_IROTH)) == 0) return nullptr;
+  if ((status.st_mode & (S_IRUSR | S_IRGRP | S_IROTH)) == 0) return false;
   const bool writable = (status.st_mode & (S_IWUSR | S_IWGRP | S_IWOTH)) != 0;
   bool lackedMemory = false;
   const SqliteFunctions* const sql = sqlite(&lackedMemory);
   if (lackedMemory) throw std::bad_alloc();
-  if (sql == nullptr) return nullptr;
+  if (sql == nullptr) return false;
   sqlite3* opened = nullptr;
   const int flags = (writable ? SQLITE_OPEN_READWRITE : SQLITE_OPEN_READONLY) | SQLITE_OPEN_NOFOLLOW |
                     SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_PRIVATECACHE;
   const int result = sql->open_v2(path.c_str(), &opened, flags, nullptr);
-  SqliteDatabase database(opened);  // to be closed even when opening failed
+  database_.reset(opened);  // to be closed even when opening failed
   if (isLackOfMemory(result)) throw std::bad_alloc();
-  if (result != SQLITE_OK) return nullptr;
-  (void)sql->db_config(opened, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
-  (void)sql->db_config(opened, SQLITE_DBCONFIG_TRUSTED_SCHEMA, 0, nullptr);
+  if (result != SQLITE_OK) return false;
+  distrustDatabase(opened);
   // SQLite opens anything and reads nothing; the first pragma that needs the file tells whether it is a
   // database. No waiting here: a locked one is a database.
   const int version = sql->exec(opened, "PRAGMA schema_version", nullptr, nullptr, nullptr);
   if (isLackOfMemory(version) || isLackOfMemory(sql->extended_errcode(opened))) throw std::bad_alloc();
-  if (isHopeless(version)) return nullptr;
+  if (isHopeless(version)) return false;
+  limit_.applyTo(opened);
   (void)sql->exec(opened, "PRAGMA synchronous=FULL; PRAGMA cell_size_check=ON", nullptr, nullptr, nullptr);
-  return database;
+  return true;
 }
 
 }  // namespace
@@ -148,9 +140,9 @@ SqliteDatabase open(const std::string& path) {
 std::unique_ptr<ContactsChannelManager> SqliteContacts::makeChannelManager(bool* lackedMemory) noexcept {
   if (lackedMemory != nullptr) *lackedMemory = false;
   try {
-    SqliteDatabase database = open(databasePath(home_()));
-    if (database == nullptr) return nullptr;
-    return std::make_unique<SqliteChannelManager>(std::move(database), patience_, longestRemap_);
+    auto manager = std::make_unique<SqliteChannelManager>(patience_, time_);
+    if (!manager->open(databasePath(home_()))) return nullptr;
+    return manager;
   } catch (const std::bad_alloc&) {
     if (lackedMemory != nullptr) *lackedMemory = true;
     return nullptr;

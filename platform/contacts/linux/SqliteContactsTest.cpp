@@ -20,6 +20,7 @@
 
 #include "platform/contacts/fakes/InMemoryContacts.h"
 #include "platform/sqlite/Sqlite.h"
+#include "platform/sqlite/fakes/ManualSqliteTime.h"
 
 namespace brenvik {
 namespace {
@@ -50,6 +51,7 @@ class Application {
   std::int64_t references(const std::string& channel) {
     return number("SELECT count(*) FROM contact_channels WHERE channel_identifier = '" + channel + "'");
   }
+  bool isReading = false;
 
  private:
   SqliteDatabase database_;
@@ -74,8 +76,8 @@ class SqliteContactsTest : public ::testing::Test {
         .run(std::string(kTable) + "INSERT INTO contact_channels VALUES(1,'old'),(2,'other'),(3,'old');" +
              more);
   }
-  SqliteContacts contacts(std::chrono::milliseconds patience = 0ms, std::chrono::milliseconds longest = 20s) {
-    return SqliteContacts([this] { return home.string(); }, patience, longest);
+  SqliteContacts contacts() {
+    return SqliteContacts([this] { return home.string(); }, SqliteContacts::kPatience, time.asTime());
   }
   // The description of the failure, or "success".
   std::string remap(const std::string& from = "old", const std::string& to = "new") {
@@ -91,6 +93,7 @@ class SqliteContactsTest : public ::testing::Test {
   }
 
   fs::path home;
+  ManualSqliteTime time;
 };
 
 TEST_F(SqliteContactsTest, EveryReferenceFollowsItsChannelAndNoOther) {
@@ -232,21 +235,89 @@ TEST_F(SqliteContactsTest, ATriggerThatNeverEndsIsCutOff) {
       "CREATE TRIGGER t AFTER UPDATE ON contact_channels BEGIN "
       "INSERT INTO contact_channels SELECT 1, 'x' WHERE 0 < (WITH RECURSIVE n(i) AS "
       "(SELECT 1 UNION ALL SELECT i + 1 FROM n) SELECT count(*) FROM n); END;");
-  const auto manager = contacts(0ms, 50ms).makeChannelManager();
-  ASSERT_NE(manager, nullptr);
-  EXPECT_EQ(remap(*manager, "old", "new"), "interrupted");
+  time.perLook = 1ms;
+  EXPECT_EQ(remap(), "interrupted");
+  EXPECT_GE(time.now, SqliteContacts::kPatience);
+  EXPECT_LT(time.now, SqliteContacts::kPatience + 100ms);
   EXPECT_EQ(Application(database()).references("old"), 2);
 }
 
-TEST_F(SqliteContactsTest, AManagerWorksAgainAfterAFailure) {
+TEST_F(SqliteContactsTest, TriggersThatWantAllMemoryAreCutOffBeforeTheyHaveMuch) {
+  // Each sets off the next, and meanwhile holds a text of 60 kilobytes.
+  constexpr int kTriggers = 800;
+  std::string triggers =
+      "CREATE TABLE t0(x); CREATE TRIGGER first AFTER UPDATE ON contact_channels "
+      "BEGIN INSERT INTO t0 VALUES(hex(zeroblob(30000))); END;";
+  for (int i = 0; i < kTriggers; ++i) {
+    const std::string number = std::to_string(i);
+    const std::string next = "t" + std::to_string(i + 1);
+    triggers += "CREATE TABLE " + next + "(x); CREATE TRIGGER r" + number + " AFTER INSERT ON t" + number +
+                " BEGIN INSERT INTO " + next + " VALUES(hex(zeroblob(30000))); END;";
+  }
+  makeDatabase("BEGIN;" + triggers + "COMMIT;");
+  (void)sqlite()->memory_highwater(1);
+  EXPECT_EQ(remap(), "out of memory");
+  EXPECT_LE(sqlite()->memory_highwater(0), kMostSqliteMemory);
+  EXPECT_EQ(Application(database()).references("old"), 2);
+}
+
+TEST_F(SqliteContactsTest, ATextLongerThanAnyIdentifierIsNotMade) {
+  makeDatabase(
+      "CREATE TRIGGER t AFTER UPDATE ON contact_channels BEGIN "
+      "INSERT INTO contact_channels VALUES(1, hex(zeroblob(50000))); END;");
+  EXPECT_EQ(remap(), "string or blob too big");
+  EXPECT_EQ(Application(database()).references("old"), 2);
+}
+
+TEST_F(SqliteContactsTest, ASchemaLargerThanTheMemoryAllowedIsALackOfMemoryAndNoMissingDatabase) {
+  (void)sqlite()->hard_heap_limit64(0);  // for whoever makes it
+  makeDatabase(
+      "PRAGMA writable_schema=ON; INSERT INTO sqlite_master WITH RECURSIVE n(i) AS "
+      "(SELECT 1 UNION ALL SELECT i + 1 FROM n WHERE i < 1000) SELECT 'view', 'v' || i, 'v' || i, 0, "
+      "'CREATE VIEW v' || i || ' AS SELECT ''' || hex(zeroblob(25000)) || ''' AS c' FROM n;");
+  (void)sqlite()->hard_heap_limit64(kMostSqliteMemory);
+  (void)sqlite()->memory_highwater(1);
+  EXPECT_EQ(remap(), "out of memory");
+  EXPECT_LE(sqlite()->memory_highwater(0), kMostSqliteMemory);
+}
+
+TEST_F(SqliteContactsTest, APipeInTheJournalsPlaceKeepsNobodyWaiting) {
   makeDatabase();
+  ASSERT_EQ(::mkfifo((database().string() + "-journal").c_str(), 0600), 0);
+  EXPECT_NE(remap(), "success");
+  fs::remove(database().string() + "-journal");
+  EXPECT_EQ(remap(), "success");
+}
+
+TEST_F(SqliteContactsTest, AllLocksTogetherAreWaitedForOnlySoLong) {
+  makeDatabase();
+  Application application(database());
+  // Let go just before the patience ends, and taken by a reader: what is left is for the end of the remap.
+  application.run("BEGIN EXCLUSIVE");
+  SqliteTime lettingGo = time.asTime();
+  lettingGo.sleepFor = [&, sleep = lettingGo.sleepFor](std::chrono::nanoseconds forTime) {
+    sleep(forTime);
+    if (time.slept < SqliteContacts::kPatience - 100ms || application.isReading) return;
+    application.run("COMMIT; BEGIN; SELECT * FROM contact_channels");
+    application.isReading = true;
+  };
+  const auto manager = SqliteContacts([this] { return home.string(); }, SqliteContacts::kPatience, lettingGo)
+                           .makeChannelManager();
+  ASSERT_NE(manager, nullptr);
+  EXPECT_EQ(remap(*manager, "old", "new"), "database is locked");
+  EXPECT_GE(time.slept, SqliteContacts::kPatience - 100ms);
+  EXPECT_LE(time.slept, SqliteContacts::kPatience);
+  application.run("COMMIT");
+  EXPECT_EQ(application.references("old"), 2);
+}
+
+TEST_F(SqliteContactsTest, AManagerWorksAgainAfterAFailure) {
+  makeDatabase(
+      "CREATE TRIGGER t BEFORE UPDATE ON contact_channels WHEN new.channel_identifier = 'refused' "
+      "BEGIN SELECT RAISE(FAIL, 'refused'); END;");
   const auto manager = contacts().makeChannelManager();
   ASSERT_NE(manager, nullptr);
-  {
-    Application application(database());
-    application.run("BEGIN IMMEDIATE");
-    EXPECT_EQ(remap(*manager, "old", "new"), "database is locked");
-  }
+  EXPECT_EQ(remap(*manager, "old", "refused"), "refused");
   EXPECT_EQ(remap(*manager, "old", "new"), "success");
   EXPECT_EQ(Application(database()).references("new"), 2);
 }
@@ -312,7 +383,7 @@ TEST_P(LargeRemapTest, AHundredThousandReferencesMoveAtOnceForAnotherProcessThat
   char byte = 0;
   EXPECT_EQ(::read(started[0], &byte, 1), 1);
 
-  const auto manager = contacts(20s).makeChannelManager();
+  const auto manager = SqliteContacts([this] { return home.string(); }, 20s).makeChannelManager();
   ASSERT_NE(manager, nullptr);
   EXPECT_EQ(remap(*manager, "old", "new"), "success");
   ::close(alive[1]);

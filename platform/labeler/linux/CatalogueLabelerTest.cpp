@@ -230,6 +230,17 @@ TEST(CatalogueLabelerTest, SharpSGivesOneLetterAndThenTheNext) {
   EXPECT_EQ(badges({"ß", "ß", "ße", "ße"}, {"de"}), (Texts{"S", "SS", "SSE", "S2"}));
 }
 
+TEST(CatalogueLabelerTest, GeorgianBadgesKeepEverydayLettersWhateverTheLanguage) {
+  // Two begin alike, and then have their first two letters.
+  EXPECT_EQ(badges(kIdentifiers, {"ka"}), (Texts{"ძ", "დ", "პ", "ბ", "მ", "მო"}));
+  for (const char* language : {"ka", "en", "el", "tr"}) {
+    EXPECT_EQ(badges({"სახლი", "სამსახური", "ა b", "ab გ"}, {language}), (Texts{"ს", "სა", "ა", "A"}))
+        << language;
+  }
+  // Capitals that somebody wrote are that person's.
+  EXPECT_EQ(badges({"Ს"}, {"ka"}), (Texts{"Ს"}));
+}
+
 TEST(CatalogueLabelerTest, ConjunctsOfIndicScriptsAreOneLetter) {
   EXPECT_EQ(badges({"व्यापार", "व्याकरण", "व्यापक", "व्यापक"}, {"hi"}), (Texts{"व्या", "व्याक", "व्याप", "व्या2"}));
   EXPECT_EQ(badges({"ప్రయాణం", "ప్రాథమిక"}, {"te"}), (Texts{"ప్ర", "ప్రా"}));

@@ -62,6 +62,21 @@ std::string visiblePartOf(const std::string& text) {
   return utf8(composed(seen));
 }
 
+// ICU's capitals, composed, with one deliberate difference: Georgian letters stay the everyday ones. (No
+// piece of text below has Georgian capitals of its own.)
+icu::UnicodeString capitals(const std::string& text, const std::string& language) {
+  UErrorCode status = U_ZERO_ERROR;
+  const icu::Locale locale = icu::Locale::forLanguageTag(language, status);
+  const icu::UnicodeString upper = composed(icu::UnicodeString::fromUTF8(text).toUpper(locale));
+  icu::UnicodeString result;
+  for (std::int32_t i = 0; i < upper.length(); i = upper.moveIndex32(i, 1)) {
+    const UChar32 c = upper.char32At(i);
+    const bool isGeorgianCapital = ublock_getCode(c) == UBLOCK_GEORGIAN_EXTENDED;
+    result.append(isGeorgianCapital ? u_tolower(c) : c);
+  }
+  return result;
+}
+
 class Clusters {
  public:
   Clusters() : iterator_(icu::BreakIterator::createCharacterInstance(icu::Locale::getRoot(), status_)) {}
@@ -121,7 +136,8 @@ constexpr const char* kPieces[] = {"a",        "i",
                                    "ж",        "й",
                                    "ё",        "ї",
                                    "ъ",        "ქ",
-                                   "თ",        "ə",
+                                   "თ",        "ა́",
+                                   "ჰჼ",       "ə",
                                    "ғ",        "ش",
                                    "أ",        "بّ",
                                    "لا",       "ک",
@@ -167,17 +183,15 @@ class RandomTexts {
   std::mt19937 random_;
 };
 
-TEST(LabelerOracleTest, CapitalsAreThoseOfIcu) {
+TEST(LabelerOracleTest, CapitalsAreThoseOfIcuButForGeorgian) {
   RandomTexts random(20240611);
   int compared = 0;
   for (int round = 0; round < 60000; ++round) {
     const std::string language = random.oneOf(kLanguages);
     const std::string text = random.label(8);
-    const icu::Locale locale =
-        icu::Locale::forLanguageTag(language, *std::make_unique<UErrorCode>(U_ZERO_ERROR));
-    const icu::UnicodeString expected = composed(icu::UnicodeString::fromUTF8(text).toUpper(locale));
     const std::string code = language.substr(0, language.find('-'));
-    ASSERT_EQ(upperCased(text, code.c_str()), utf8(expected)) << language << ": \"" << text << '"';
+    ASSERT_EQ(upperCased(text, code.c_str()), utf8(capitals(text, language)))
+        << language << ": \"" << text << '"';
     ++compared;
   }
   EXPECT_EQ(compared, 60000);
@@ -192,14 +206,11 @@ TEST(LabelerOracleTest, ASingleBadgeIsTheFirstClusterOfTheCapitalsThatIcuFinds) 
     const std::string language = random.oneOf(kLanguages);
     const std::string text = random.label(8);
     if (text.empty() || text.front() == ' ') continue;
-    UErrorCode status = U_ZERO_ERROR;
-    const icu::Locale locale = icu::Locale::forLanguageTag(language, status);
-    const icu::UnicodeString upper = composed(icu::UnicodeString::fromUTF8(text).toUpper(locale));
     const PropertyList badges =
         labeler.localizedBadgeLabels(PropertyList::array({PropertyList::string(text)}),
                                      PropertyList::array({PropertyList::string(language)}));
     ASSERT_EQ(badges.size(), 1U);
-    ASSERT_EQ(badges.at(0).asString().value(), utf8(clusters.first(upper)))
+    ASSERT_EQ(badges.at(0).asString().value(), utf8(clusters.first(capitals(text, language))))
         << language << ": \"" << text << '"';
     ++compared;
   }

@@ -7,6 +7,7 @@
 #include <uninorm.h>
 #include <unistr.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdlib>
 #include <memory>
@@ -20,6 +21,7 @@ struct Free {
 };
 using Characters = std::unique_ptr<ucs4_t, Free>;
 
+constexpr std::size_t kGeorgianSize = 3;  // bytes of a letter
 constexpr ucs4_t kDialytika = 0x0308;
 constexpr ucs4_t kTonos = 0x0301;
 constexpr ucs4_t kYpogegrammeni = 0x0345;
@@ -158,11 +160,26 @@ std::string armenianWithoutLigature(std::string_view text) {
   }
 }
 
+// Georgian is written in one case. Its capitals (Mtavruli) are for headings in them throughout: a lone one
+// looks foreign, and many fonts lack them. Everyday letters, U+10D0 to U+10FF, are E1 83 90 to E1 83 BF.
+std::size_t findGeorgian(std::string_view text, std::size_t at) noexcept {
+  for (at = text.find("\xE1\x83", at); at != std::string_view::npos; at = text.find("\xE1\x83", at + 3)) {
+    if (static_cast<unsigned char>(text[at + 2]) >= 0x90) return at;
+  }
+  return text.size();
+}
+
 // What libunistring has made; nothing but memory can have been in its way, for the text is UTF-8.
 std::string owned(std::uint8_t* made, std::size_t size) {
   const std::unique_ptr<std::uint8_t, Free> bytes(made);
   if (bytes == nullptr) throw std::bad_alloc();
   return {reinterpret_cast<const char*>(bytes.get()), size};
+}
+
+std::string upperCasedRun(std::string_view text, const char* language) {
+  std::size_t size = 0;
+  std::uint8_t* const upper = u8_toupper(bytesOf(text), text.size(), language, UNINORM_NFC, nullptr, &size);
+  return owned(upper, size);
 }
 
 }  // namespace
@@ -177,9 +194,16 @@ std::string upperCased(std::string_view text, const char* language) {
     prepared = armenianWithoutLigature(text);
     text = prepared;
   }
-  std::size_t size = 0;
-  std::uint8_t* const upper = u8_toupper(bytesOf(text), text.size(), language, UNINORM_NFC, nullptr, &size);
-  return owned(upper, size);
+  // Georgian letters stand between others as they are: no rule of capitals looks across them, and no mark
+  // composes with them.
+  std::string result;
+  for (std::size_t at = 0; at < text.size();) {
+    const std::size_t georgian = findGeorgian(text, at);
+    if (georgian > at) result += upperCasedRun(text.substr(at, georgian - at), language);
+    at = std::min(georgian + kGeorgianSize, text.size());
+    result += text.substr(georgian, at - georgian);
+  }
+  return result;
 }
 
 std::string composed(std::string_view text) {

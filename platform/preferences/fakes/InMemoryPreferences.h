@@ -54,7 +54,7 @@ class InMemoryDisk {
 };
 
 // A preferences store without files, no kinder than the one with them: nothing reaches others before
-// synchronize(), nothing of others is seen before it, and a full disk drops what was set. Any thread.
+// synchronize(), and a full disk drops what was set. Any thread.
 class InMemoryPreferences final : public PreferencesStore {
  public:
   // With a disk of its own, or one that it shares and that outlives it.
@@ -72,7 +72,7 @@ class InMemoryPreferences final : public PreferencesStore {
     }
     if (runsOutOfMemory()) return false;
     const std::lock_guard lock(mutex_);
-    domains_[{std::string(domain), user, host}].pending.insert_or_assign(std::string(key), value);
+    pending_[{std::string(domain), user, host}].insert_or_assign(std::string(key), value);
     return true;
   }
 
@@ -80,19 +80,13 @@ class InMemoryPreferences final : public PreferencesStore {
     if (!namesPreferencesFile(domain)) return Synchronized::notWhole();
     const std::lock_guard lock(mutex_);
     const InMemoryDisk::DomainName name{std::string(domain), user, host};
-    Cached& cached = domains_[name];
-    if (runsOutOfMemory()) {
-      cached.pending.clear();
-      return Synchronized::withoutMemory();
-    }
-    auto pending = std::exchange(cached.pending, {});
+    auto pending = std::exchange(pending_[name], {});
+    if (runsOutOfMemory()) return Synchronized::withoutMemory();
     const bool isSound =
         std::erase_if(pending, [](const auto& one) { return !canBeStored(one.first, one.second); }) == 0;
     if (!isSound) logUnified(LogLevel::error, "Preferences: a value is too deep or too large to be stored");
     const bool isStored = pending.empty() || disk_->merge(name, pending);
     if (!isStored) logUnified(LogLevel::error, "Preferences: the disk is full");
-    cached.values = disk_->read(name);
-    cached.isLoaded = true;
     return isStored && isSound ? Synchronized::whole() : Synchronized::notWhole();
   }
 
@@ -103,14 +97,13 @@ class InMemoryPreferences final : public PreferencesStore {
     if (runsOutOfMemory()) return false;
     const std::lock_guard lock(mutex_);
     const InMemoryDisk::DomainName name{std::string(domain), user, host};
-    Cached& cached = domains_[name];
-    if (const auto set = cached.pending.find(key); set != cached.pending.end()) {
+    const InMemoryDisk::Values& pending = pending_[name];
+    if (const auto set = pending.find(key); set != pending.end()) {
       *value = set->second;
       return true;
     }
-    if (!std::exchange(cached.isLoaded, true)) cached.values = disk_->read(name);
-    const auto found = cached.values.find(key);
-    if (found != cached.values.end()) *value = found->second;
+    const InMemoryDisk::Values values = disk_->read(name);
+    if (const auto found = values.find(key); found != values.end()) *value = found->second;
     return true;
   }
 
@@ -135,12 +128,6 @@ class InMemoryPreferences final : public PreferencesStore {
   void flushCachesForAnyUser(const std::string* domain) noexcept override {
     const std::lock_guard lock(mutex_);
     flushes.push_back(domain != nullptr ? std::optional<std::string>(*domain) : std::nullopt);
-    if (domain == nullptr) return;
-    for (auto& [name, cached] : domains_) {
-      if (std::get<0>(name) != *domain) continue;
-      cached.values.clear();
-      cached.isLoaded = false;
-    }
   }
 
   // What was asked to be flushed, in order; nothing: no domain in particular. Read it from the thread under
@@ -151,12 +138,6 @@ class InMemoryPreferences final : public PreferencesStore {
   int operationsWithMemory = -1;
 
  private:
-  struct Cached {
-    InMemoryDisk::Values pending;
-    InMemoryDisk::Values values;
-    bool isLoaded = false;
-  };
-
   bool runsOutOfMemory() noexcept {
     if (operationsWithMemory < 0) return false;
     if (operationsWithMemory == 0) return true;
@@ -173,7 +154,7 @@ class InMemoryPreferences final : public PreferencesStore {
   InMemoryDisk own_;
   InMemoryDisk* const disk_;
   std::mutex mutex_;
-  std::map<InMemoryDisk::DomainName, Cached> domains_;
+  std::map<InMemoryDisk::DomainName, InMemoryDisk::Values> pending_;
 };
 
 }  // namespace brenvik

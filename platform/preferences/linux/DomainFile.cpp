@@ -13,11 +13,12 @@
 #include <climits>
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
 #include <ctime>
 #include <thread>
 #include <utility>
 
+#include "platform/base/ErrorText.h"
+#include "platform/base/Rename.h"
 #include "platform/log/Log.h"
 #include "platform/plist/PropertyListCodec.h"
 
@@ -34,11 +35,6 @@ constexpr std::int64_t kSettlingTime = 50'000'000;  // ns
 // How often a file is read again that changed while it was read.
 constexpr int kReadAttempts = 3;
 constexpr int kMostMovedAside = 1000;
-
-const char* describe(int error) noexcept {
-  const char* const text = ::strerrordesc_np(error);
-  return text != nullptr ? text : "unknown error";
-}
 
 std::int64_t nanoseconds(const timespec& time) noexcept {
   return std::int64_t{time.tv_sec} * 1'000'000'000 + time.tv_nsec;
@@ -97,19 +93,6 @@ int writeAll(int file, std::span<const std::string_view> content) noexcept {
     }
   }
   return 0;
-}
-
-// Fails with EEXIST when the name is taken.
-int renameToFreeName(int folder, const char* from, const char* to) noexcept {
-  if (::renameat2(folder, from, folder, to, RENAME_NOREPLACE) == 0) return 0;
-  if (errno != EINVAL) return -1;
-  // A file system that knows no flags. The lock keeps other writers from taking the name meanwhile.
-  struct stat facts;
-  if (::fstatat(folder, to, &facts, AT_SYMLINK_NOFOLLOW) == 0) {
-    errno = EEXIST;
-    return -1;
-  }
-  return ::renameat(folder, from, folder, to);
 }
 
 }  // namespace
@@ -299,7 +282,7 @@ bool DomainFile::replace(int folder, std::span<const std::string_view> content, 
 }
 
 bool DomainFile::moveAside(int folder, const Attempt& attempt) const {
-  const char* const reason = attempt.error != 0 ? describe(attempt.error) : attempt.damage;
+  const char* const reason = attempt.error != 0 ? describeError(attempt.error) : attempt.damage;
   int error = 0;
   for (int number = 1; number <= kMostMovedAside; ++number) {
     const std::string suffix = ".damaged-" + std::to_string(number);
@@ -315,14 +298,14 @@ bool DomainFile::moveAside(int folder, const Attempt& attempt) const {
   }
   logUnified(LogLevel::error,
              "Preferences %s: damaged (%s) and cannot be moved aside (%s); nothing is stored there",
-             path_.c_str(), reason, describe(error));
+             path_.c_str(), reason, describeError(error));
   return false;
 }
 
 // Says what went wrong; always false.
 bool DomainFile::fail(const char* call, int error) const noexcept {
   logUnified(LogLevel::error, "Preferences %s: %s: %s", path_.c_str(), call,
-             error == EWOULDBLOCK ? "another writer does not let go of the lock" : describe(error));
+             error == EWOULDBLOCK ? "another writer does not let go of the lock" : describeError(error));
   return false;
 }
 

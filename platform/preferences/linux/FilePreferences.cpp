@@ -14,6 +14,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/base/ErrorText.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/preferences/linux/DomainFile.h"
@@ -30,7 +31,7 @@ namespace {
 constexpr std::size_t kMostDomains = 16;
 constexpr std::size_t kMostKeptBytes = std::size_t{16} << 20;
 
-std::string homeOfEffectiveUser() {
+std::string homeOfEffectiveUser(int* failure) {
   std::vector<char> buffer(1024);
   passwd entry{};
   passwd* found = nullptr;
@@ -40,20 +41,30 @@ std::string homeOfEffectiveUser() {
     buffer.resize(buffer.size() * 2);
     errno = 0;
   }
-  // A look-up that lacked memory may say that there is no such account; errno keeps the truth.
-  if (found == nullptr && (error == ENOMEM || errno == ENOMEM)) throw std::bad_alloc();
-  return error == 0 && found != nullptr && found->pw_dir != nullptr ? found->pw_dir : "";
+  if (error == 0 && found != nullptr && found->pw_dir != nullptr) return found->pw_dir;
+  // A look-up that failed may say that there is no such account; errno keeps the truth.
+  if (error == ENOMEM || errno == ENOMEM) throw std::bad_alloc();
+  *failure = error != 0 ? error : errno;
+  return {};
 }
 
 // machine-id(5): 32 lower-case hexadecimal digits and a line feed.
-std::string machineId() {
+std::string machineId(int* failure) {
   const UniqueFd file(::open("/etc/machine-id", O_RDONLY | O_CLOEXEC | O_NOCTTY));
   std::array<char, 64> text{};
   const ssize_t got = file.isValid() ? ::read(file.get(), text.data(), text.size()) : -1;
-  std::string id(text.data(), got > 0 ? static_cast<std::size_t>(got) : 0);
+  if (got < 0) {
+    *failure = errno;
+    return {};
+  }
+  std::string id(text.data(), static_cast<std::size_t>(got));
   if (!id.empty() && id.back() == '\n') id.pop_back();
   const bool isId = id.size() == 32 && id.find_first_not_of("0123456789abcdef") == std::string::npos;
   return isId ? id : std::string();
+}
+
+void keepKnown(std::string& known, std::string& found) {
+  if (known.empty()) known = std::move(found);
 }
 
 }  // namespace
@@ -78,7 +89,8 @@ class FilePreferences::Domain {
   PropertyList copyValue(std::string_view key) {
     const std::lock_guard lock(mutex_);
     if (const auto set = pending_.find(key); set != pending_.end()) return set->second;
-    if (!isLoaded_) load(nullptr);
+    // Somebody may have replaced or removed the file since: one look, and a read only if it changed.
+    if (!isCurrent()) load(nullptr);
     return image_.find(key);
   }
 
@@ -184,7 +196,11 @@ class FilePreferences::Domain {
 };
 
 FilePreferences::Places FilePreferences::systemPlaces() {
-  return {homeOfEffectiveUser(), BRENVIK_ANY_USER_PREFERENCES, machineId()};
+  Places places;
+  places.home = homeOfEffectiveUser(&places.homeError);
+  places.anyUser = BRENVIK_ANY_USER_PREFERENCES;
+  places.machineId = machineId(&places.machineIdError);
+  return places;
 }
 
 FilePreferences::FilePreferences(std::function<Places()> places, std::chrono::milliseconds patience)
@@ -192,9 +208,23 @@ FilePreferences::FilePreferences(std::function<Places()> places, std::chrono::mi
 
 FilePreferences::~FilePreferences() = default;
 
+void FilePreferences::lookUpPlaces(UserScope user, HostScope host) {
+  const bool isKnown = places_ && !(user == UserScope::currentUser && places_->home.empty()) &&
+                       !(host == HostScope::currentHost && places_->machineId.empty());
+  if (isKnown) return;
+  Places found = askForPlaces_();
+  if (!places_) places_.emplace();
+  // What was found once stays, even if this look-up failed.
+  keepKnown(places_->home, found.home);
+  keepKnown(places_->anyUser, found.anyUser);
+  keepKnown(places_->machineId, found.machineId);
+  places_->homeError = found.homeError;
+  places_->machineIdError = found.machineIdError;
+}
+
 std::optional<DomainPlace> FilePreferences::placeOf(std::string_view domain, UserScope user, HostScope host) {
   if (!namesPreferencesFile(domain)) return std::nullopt;
-  if (!places_) places_ = askForPlaces_();
+  lookUpPlaces(user, host);
   DomainPlace place;
   if (user == UserScope::currentUser) {
     if (places_->home.empty()) return std::nullopt;
@@ -212,6 +242,24 @@ std::optional<DomainPlace> FilePreferences::placeOf(std::string_view domain, Use
   }
   place.name += ".plist";
   return place;
+}
+
+void FilePreferences::logNothingStored(std::string_view domain, UserScope user, HostScope host) {
+  if (!namesPreferencesFile(domain)) {
+    logUnified(LogLevel::error, "Preferences: domain \"%.*s\" names no file, nothing is stored",
+               static_cast<int>(domain.size()), domain.data());
+    return;
+  }
+  const std::lock_guard lock(mutex_);
+  const bool lacksHome = user == UserScope::currentUser && places_ && places_->home.empty();
+  const bool lacksMachine = host == HostScope::currentHost && places_ && places_->machineId.empty();
+  const int error = lacksHome ? places_->homeError : lacksMachine ? places_->machineIdError : 0;
+  logUnified(LogLevel::error, "Preferences: no %s is known (%s), the value for domain \"%.*s\" is not stored",
+             lacksHome      ? "home directory"
+             : lacksMachine ? "machine id"
+                            : "folder",
+             error != 0 ? describeError(error) : "there is none", static_cast<int>(domain.size()),
+             domain.data());
 }
 
 std::shared_ptr<FilePreferences::Domain> FilePreferences::find(std::string_view domain, UserScope user,
@@ -244,8 +292,7 @@ bool FilePreferences::setValue(std::string_view key, const PropertyList& value, 
     if (const auto found = find(domain, user, host)) {
       found->setValue(key, value);
     } else {
-      logUnified(LogLevel::error, "Preferences: domain \"%.*s\" names no file, nothing is stored",
-                 static_cast<int>(domain.size()), domain.data());
+      logNothingStored(domain, user, host);
     }
     return true;
   } catch (const std::bad_alloc&) {

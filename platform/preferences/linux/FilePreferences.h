@@ -31,17 +31,20 @@ struct DomainPlace;
 class FilePreferences final : public PreferencesStore {
  public:
   struct Places {
-    std::string home;       // of the user whose preferences these are; empty: has none
+    std::string home;       // of the user whose preferences these are; empty: none is known
     std::string anyUser;    // absolute
-    std::string machineId;  // empty: unknown, so that nothing can be kept for the current host
+    std::string machineId;  // empty: none is known, so that nothing can be kept for the current host
+    int homeError = 0;      // errno of a look-up that failed; 0: there is none
+    int machineIdError = 0;
   };
-  // The effective user's home directory, the folder compiled in, and /etc/machine-id.
+  // The effective user's home directory, the folder compiled in, and /etc/machine-id. Throws std::bad_alloc.
   static Places systemPlaces();
 
   // How long a writer waits for others that write in the same folder, before it gives up.
   static constexpr std::chrono::milliseconds kPatience{1000};
 
-  // `places` is asked once, when the first domain is used.
+  // `places` is asked when the first domain is used, and again by each operation that needs a place that is
+  // not known: a look-up may fail at one moment and succeed at the next.
   explicit FilePreferences(std::function<Places()> places = systemPlaces,
                            std::chrono::milliseconds patience = kPatience);
   FilePreferences(const FilePreferences&) = delete;
@@ -61,15 +64,17 @@ class FilePreferences final : public PreferencesStore {
  private:
   class Domain;
 
+  void lookUpPlaces(UserScope user, HostScope host);
   std::optional<DomainPlace> placeOf(std::string_view domain, UserScope user, HostScope host);
+  void logNothingStored(std::string_view domain, UserScope user, HostScope host);
   // Null when the domain names no file there. May throw std::bad_alloc, but not for a domain that is known:
   // what was set there can always be stored or dropped.
   std::shared_ptr<Domain> find(std::string_view domain, UserScope user, HostScope host);
 
   const std::function<Places()> askForPlaces_;
   const std::chrono::milliseconds patience_;
-  std::mutex mutex_;  // of what follows; never held while a domain works
-  std::optional<Places> places_;
+  std::mutex mutex_;                            // of what follows; never held while a domain works
+  std::optional<Places> places_;                // what is known of them
   std::list<std::shared_ptr<Domain>> domains_;  // last used first
 };
 

@@ -7,6 +7,7 @@
 #include <sched.h>
 #include <sys/file.h>
 #include <sys/mount.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -118,7 +119,7 @@ TEST_F(FilePreferencesTest, ReadingMakesNothing) {
   EXPECT_TRUE(log.entries().empty());
 }
 
-TEST_F(FilePreferencesTest, PlacesAreAskedForOnceAndNotBeforeTheyAreNeeded) {
+TEST_F(FilePreferencesTest, PlacesThatAreKnownAreAskedForOnceAndNotBeforeTheyAreNeeded) {
   int asked = 0;
   FilePreferences store([&] {
     ++asked;
@@ -143,13 +144,61 @@ TEST_F(FilePreferencesTest, WithoutAHomeOrAMachineIdThoseScopesHoldNothing) {
                                   {kUser, HostScope::currentHost},
                                   {UserScope::anyUser, HostScope::currentHost}}) {
     store.setValue("key", PropertyList::boolean(true), kDomain, user, host);
-    EXPECT_EQ(onlyLine(), "Preferences: domain \"com.example.files\" names no file, nothing is stored");
+    EXPECT_EQ(onlyLine(),
+              std::string("Preferences: no ") +
+                  (user == UserScope::currentUser ? "home directory" : "machine id") +
+                  " is known (there is none), the value for domain \"com.example.files\" is not stored");
     EXPECT_FALSE(store.synchronize(kDomain, user, host));
     EXPECT_FALSE(store.copyValue("key", kDomain, user, host));
   }
   store.setValue("key", PropertyList::boolean(true), kDomain, UserScope::anyUser, kHost);
   EXPECT_TRUE(store.synchronizeApplication(kDomain));
   EXPECT_TRUE(store.copyApplicationValue("key", kDomain));
+}
+
+TEST_F(FilePreferencesTest, AFailedLookUpOfAPlaceIsToldAndTheNextOneDecidesAnew) {
+  FilePreferences::Places answer{"", home.anyUser(), "", EMFILE, ENFILE};
+  FilePreferences store([&answer] { return answer; });
+  EXPECT_EQ(get(store, "key"), "(none)");
+  EXPECT_FALSE(setNow(store, "key", "lost"));
+  EXPECT_EQ(onlyLine(),
+            "Preferences: no home directory is known (Too many open files), the value for domain "
+            "\"com.example.files\" is not stored");
+  store.setValue("key", PropertyList::boolean(true), kDomain, UserScope::anyUser, HostScope::currentHost);
+  EXPECT_EQ(onlyLine(),
+            "Preferences: no machine id is known (Too many open files in system), the value for domain "
+            "\"com.example.files\" is not stored");
+
+  answer = home.places();
+  EXPECT_TRUE(setNow(store, "key", "kept"));
+  EXPECT_EQ(onDisk(), textDictionary("key", "kept"));
+  // What is known stays known: a look-up for the one does not lose the other.
+  answer = {"", "", TestHome::kMachine, EMFILE, 0};
+  store.setValue("key", PropertyList::boolean(true), kDomain, kUser, HostScope::currentHost);
+  EXPECT_TRUE(store.synchronize(kDomain, kUser, HostScope::currentHost));
+  EXPECT_TRUE(
+      fs::exists(home.folder() / "ByHost" / (std::string(kDomain) + "." + TestHome::kMachine + ".plist")));
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(FilePreferencesTest, WithoutADescriptorForTheLookUpASetIsLostWithALineAndTheNextOneIsStored) {
+  FilePreferences store([this] {
+    auto places = FilePreferences::systemPlaces();
+    if (!places.home.empty()) places.home = home.home();
+    return places;
+  });
+  rlimit usual{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &usual), 0);
+  const rlimit none{0, usual.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &none), 0);
+  const bool isStored = setNow(store, "key", "lost");
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &usual), 0);
+  EXPECT_FALSE(isStored);
+  EXPECT_EQ(onlyLine(),
+            "Preferences: no home directory is known (Too many open files), the value for domain "
+            "\"com.example.files\" is not stored");
+  EXPECT_TRUE(setNow(store, "key", "kept"));
+  EXPECT_EQ(onDisk(), textDictionary("key", "kept"));
 }
 
 TEST_F(FilePreferencesTest, AHomeThatDoesNotExistIsNotMade) {
@@ -362,8 +411,6 @@ TEST_F(FilePreferencesTest, AReplacedFileIsSeenEvenWithTheSameSizeAndTime) {
   fs::remove(file);
   home.write(kDomain, binary(textDictionary("key", "two")));
   ASSERT_EQ(::utimensat(AT_FDCWD, file.c_str(), old, 0), 0);
-  EXPECT_EQ(get(*ours, "key"), "one");
-  ASSERT_TRUE(sync(*ours));
   EXPECT_EQ(get(*ours, "key"), "two");
 }
 
@@ -394,6 +441,7 @@ TEST_F(FilePreferencesTest, ASettledFileIsNotReadAgain) {
 TEST_F(FilePreferencesTest, ARemovedFileIsAnEmptyDomain) {
   ASSERT_TRUE(setNow(*ours, "key", "value"));
   fs::remove_all(home.home() / "Library");
+  EXPECT_EQ(get(*ours, "key"), "(none)");
   ASSERT_TRUE(sync(*ours));
   EXPECT_EQ(get(*ours, "key"), "(none)");
   ASSERT_TRUE(setNow(*ours, "another", "value"));

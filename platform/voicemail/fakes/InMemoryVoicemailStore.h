@@ -17,35 +17,48 @@ class InMemoryVoicemailStore final : public VoicemailStore {
   std::vector<std::string> calls;  // names of the operations
 
   bool exhausted = false;  // there is no memory
+  int failures = 0;        // for so many operations there will be none
 
   bool setToken(const std::string* token) noexcept override {
     calls.push_back(token == nullptr ? "clearToken" : "setToken");
-    if (!exhausted) token_ = token == nullptr ? std::nullopt : std::optional(*token);
-    return !exhausted;
+    if (fails()) return false;
+    token_ = token == nullptr ? std::nullopt : std::optional(*token);
+    return true;
   }
   bool setTokenForKey(const std::string& key, const std::string& token) noexcept override {
     calls.push_back("setTokenForKey");
-    if (!exhausted) tokens_[key] = token;
-    return !exhausted;
+    if (fails()) return false;
+    tokens_[key] = token;
+    return true;
   }
   bool removeAllRecords() noexcept override {
     calls.push_back("removeAllRecords");
-    if (!exhausted) tokens_.clear();
-    return !exhausted;
+    if (fails()) return false;
+    tokens_.clear();
+    return true;
   }
   bool readToken(std::optional<std::string>* token) noexcept override {
     calls.push_back("readToken");
-    *token = exhausted ? std::nullopt : token_;
-    return !exhausted;
+    const bool failed = fails();
+    *token = failed ? std::nullopt : token_;
+    return !failed;
   }
   bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept override {
     calls.push_back("readTokenForKey");
     const auto found = tokens_.find(key);
-    *token = exhausted || found == tokens_.end() ? std::nullopt : std::optional(found->second);
-    return !exhausted;
+    const bool failed = fails();
+    *token = failed || found == tokens_.end() ? std::nullopt : std::optional(found->second);
+    return !failed;
   }
 
  private:
+  bool fails() noexcept {
+    if (exhausted) return true;
+    if (failures == 0) return false;
+    --failures;
+    return true;
+  }
+
   std::optional<std::string> token_;
   std::map<std::string, std::string> tokens_;
 };

@@ -12,15 +12,19 @@
 #include <memory>
 #include <new>
 
+#include "platform/base/ErrorText.h"
+#include "platform/base/Rename.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
-#include "platform/sqlite/Sqlite.h"
+#include "platform/sqlite/ForeignDatabase.h"
 
 namespace brenvik {
 namespace {
 
-constexpr int kBusyMilliseconds = 1000;  // as long as the main loop may wait for another process
+// "voicemail.db.damaged", then "voicemail.db.damaged.1" and so on.
+constexpr int kMostMovedAside = 100;
 
+constexpr const char* kFile = "voicemail.db";
 constexpr const char* kFolderInTheMaking = ".brenvik-folder";
 
 constexpr const char* kSchema =
@@ -47,7 +51,11 @@ UniqueFd enterDirectory(int parent, const char* name, mode_t mode, uid_t uid, gi
     (void)::unlinkat(parent, kFolderInTheMaking, AT_REMOVEDIR);  // the next attempt copes with what stays
     return {};
   }
-  (void)::fsync(parent);  // or a power cut takes the folder with the tokens in it
+  // Or a power cut takes the folder with the tokens in it. The next attempt makes it again.
+  if (::fsync(parent) != 0) {
+    (void)::unlinkat(parent, name, AT_REMOVEDIR);
+    return {};
+  }
   return fd;
 }
 
@@ -56,8 +64,8 @@ UniqueFd enterDirectory(int parent, const char* name, mode_t mode, uid_t uid, gi
 // One opened database.
 class SqliteVoicemailStore::Database {
  public:
-  // SQLITE_OK or SQLite's extended code.
-  int open(const std::string& file) {
+  // SQLITE_OK or SQLite's extended code. The limit outlives the object.
+  int open(const std::string& file, SqliteTimeLimit& limit) {
     bool lackedMemory = false;
     if (sqlite(&lackedMemory) == nullptr) return lackedMemory ? SQLITE_NOMEM : SQLITE_CANTOPEN;
     sqlite3* opened = nullptr;
@@ -67,13 +75,14 @@ class SqliteVoicemailStore::Database {
                                        nullptr);
     handle_.reset(opened);
     if (code != SQLITE_OK) return code;
-    // The file belongs to an ordinary account: nothing in its schema is believed.
-    sqlite()->db_config(opened, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
-    sqlite()->db_config(opened, SQLITE_DBCONFIG_TRUSTED_SCHEMA, 0, nullptr);
+    // The file belongs to an ordinary account.
+    distrustDatabase(opened);
     sqlite()->db_config(opened, SQLITE_DBCONFIG_ENABLE_TRIGGER, 0, nullptr);
     sqlite()->db_config(opened, SQLITE_DBCONFIG_ENABLE_VIEW, 0, nullptr);
-    sqlite()->busy_timeout(opened, kBusyMilliseconds);
-    const int failed = execute("PRAGMA journal_mode=DELETE; PRAGMA synchronous=FULL;");
+    limit.applyTo(opened);
+    // EXTRA: the folder is synced as well when the journal goes, or a power cut could bring the journal back,
+    // and with it the state before a change that was answered.
+    const int failed = execute("PRAGMA journal_mode=DELETE; PRAGMA synchronous=EXTRA;");
     return failed != SQLITE_OK ? failed : execute(kSchema);
   }
 
@@ -109,50 +118,79 @@ class SqliteVoicemailStore::Database {
   SqliteDatabase handle_;
 };
 
-// Makes the folders and the empty file, each with its owner and mode, and gives the file's path. SQLite
-// refuses a path with a link in it, so links above the home are resolved first.
-bool SqliteVoicemailStore::makePlace(std::string* file, IfMissing ifMissing) {
+// Where the database is.
+struct SqliteVoicemailStore::Place {
+  UniqueFd folder;
+  std::string file;  // its path
+};
+
+// Makes the folders and the empty file, each with its owner and mode. SQLite refuses a path with a link in
+// it, so links above the home are resolved first.
+SqliteVoicemailStore::Found SqliteVoicemailStore::find(Place* place, IfMissing ifMissing) {
+  const auto missing = [] { return errno == ENOENT ? Found::nothing : Found::unusable; };
   const Account account = account_();
-  if (account.home.empty()) return false;
+  if (account.home.empty()) return Found::nothing;
   const std::unique_ptr<char, decltype(&std::free)> home(::realpath(account.home.c_str(), nullptr),
                                                          &std::free);
   if (!home && errno == ENOMEM) throw std::bad_alloc();
-  if (!home) return false;
+  if (!home) return missing();
   const bool create = ifMissing == IfMissing::create;
   const UniqueFd top(::open(home.get(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!top.isValid()) return missing();
   const UniqueFd library = enterDirectory(top.get(), "Library", 0755, account.uid, account.gid, create);
-  const UniqueFd folder = enterDirectory(library.get(), "Voicemail", 0700, account.uid, account.gid, create);
-  if (!folder.isValid()) return false;
-  UniqueFd database(::openat(folder.get(), "voicemail.db", O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  if (!library.isValid()) return missing();
+  place->folder = enterDirectory(library.get(), "Voicemail", 0700, account.uid, account.gid, create);
+  if (!place->folder.isValid()) return missing();
+  const int folder = place->folder.get();
+  UniqueFd database(::openat(folder, kFile, O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
   if (!database.isValid() && errno == ENOENT && create) {
-    database.reset(
-        ::openat(folder.get(), "voicemail.db", O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
+    database.reset(::openat(folder, kFile, O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   }
+  if (!database.isValid()) return missing();
   struct stat info {};
-  if (!database.isValid() || ::fstat(database.get(), &info) != 0 || !S_ISREG(info.st_mode)) return false;
+  if (::fstat(database.get(), &info) != 0 || !S_ISREG(info.st_mode)) return Found::unusable;
   // The journal takes its owner and mode from the database. Of a name elsewhere nothing is given away.
   if ((info.st_uid != account.uid || info.st_gid != account.gid) && info.st_nlink == 1 &&
       ::fchown(database.get(), account.uid, account.gid) != 0) {
-    return false;
+    return Found::unusable;
   }
-  if ((info.st_mode & 07777) != 0600 && ::fchmod(database.get(), 0600) != 0) return false;
-  *file = std::string(home.get()) + "/Library/Voicemail/voicemail.db";
-  return true;
+  if ((info.st_mode & 07777) != 0600 && ::fchmod(database.get(), 0600) != 0) return Found::unusable;
+  place->file = std::string(home.get()) + "/Library/Voicemail/" + kFile;
+  return Found::database;
+}
+
+// Nothing in it can be read any more; a person may still want to look at it, so an earlier one stays, too.
+bool SqliteVoicemailStore::moveAside(const Place& place) {
+  int error = 0;
+  for (int number = 0; number < kMostMovedAside; ++number) {
+    std::string name = std::string(kFile) + ".damaged";
+    if (number > 0) name += "." + std::to_string(number);
+    if (renameToFreeName(place.folder.get(), kFile, name.c_str()) == 0) {
+      logUnified(LogLevel::error, "The voicemail store is damaged; moved aside to %s", name.c_str());
+      return true;
+    }
+    error = errno;
+    if (error != EEXIST) break;
+  }
+  logUnified(LogLevel::error, "The voicemail store is damaged and cannot be moved aside (%s)",
+             describeError(error));
+  return false;
 }
 
 bool SqliteVoicemailStore::write(const char* statement, const std::string* first,
                                  const std::string* second) noexcept {
   int code = SQLITE_CANTOPEN;
   try {
-    std::string file;
-    for (int attempt = 0; attempt < 2 && makePlace(&file, IfMissing::create); ++attempt) {
-      Database database;
-      code = database.open(file);
-      if (code == SQLITE_OK) code = database.run(statement, first, second, nullptr);
-      if (!isDamage(code)) break;
-      // Nothing in it can be read any more; a person may still want to look at it.
-      logUnified(LogLevel::error, "The voicemail store is damaged; moved aside to voicemail.db.damaged");
-      if (::rename(file.c_str(), (file + ".damaged").c_str()) != 0) break;
+    SqliteTimeLimit limit(kPatience, time_);
+    for (int attempt = 0; attempt < 2; ++attempt) {
+      Place place;
+      if (find(&place, IfMissing::create) != Found::database) break;
+      {
+        Database database;
+        code = database.open(place.file, limit);
+        if (code == SQLITE_OK) code = database.run(statement, first, second, nullptr);
+      }
+      if (!isDamage(code) || !moveAside(place)) break;
     }
   } catch (const std::bad_alloc&) {
     code = SQLITE_NOMEM;
@@ -164,16 +202,22 @@ bool SqliteVoicemailStore::write(const char* statement, const std::string* first
 bool SqliteVoicemailStore::read(const char* statement, const std::string* key,
                                 std::optional<std::string>* token) noexcept {
   token->reset();
+  int code = SQLITE_CANTOPEN;
   try {
-    std::string file;
-    if (!makePlace(&file, IfMissing::fail)) return true;
-    Database database;
-    int code = database.open(file);
-    if (code == SQLITE_OK) code = database.run(statement, key, nullptr, token);
-    return !isLackOfMemory(code);
+    SqliteTimeLimit limit(kPatience, time_);
+    Place place;
+    const Found found = find(&place, IfMissing::fail);
+    if (found == Found::nothing) return true;
+    if (found == Found::database) {
+      Database database;
+      code = database.open(place.file, limit);
+      if (code == SQLITE_OK) code = database.run(statement, key, nullptr, token);
+    }
   } catch (const std::bad_alloc&) {
-    return false;
+    code = SQLITE_NOMEM;
   }
+  if (code != SQLITE_OK) logUnified(LogLevel::error, "The voicemail store could not be read");
+  return !isLackOfMemory(code);
 }
 
 bool SqliteVoicemailStore::setToken(const std::string* token) noexcept {

@@ -6,23 +6,34 @@
 #include <sched.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/files/fakes/ChildProcesses.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/log/fakes/RecordingLog.h"
+#include "platform/sqlite/fakes/ManualSqliteTime.h"
 #include "platform/voicemail/fakes/InMemoryVoicemailStore.h"
 #include "platform/voicemail/linux/DynamicVisualVoicemail.h"
 
+extern "C" int fsync(int file) {
+  if (brenvik::FailingCall::failsNow("fsync")) return -1;
+  return static_cast<int>(::syscall(SYS_fsync, file));
+}
+
 namespace brenvik {
 namespace {
+
+using namespace std::chrono_literals;
 
 // ---- what every store does
 
@@ -88,6 +99,17 @@ class SqliteVoicemailStoreTest : public testing::Test {
   std::string file = home / "Library/Voicemail/voicemail.db";
   SqliteVoicemailStore store{home.path(), ::getuid(), ::getgid()};
   const std::string token = "token";
+
+  static RecordingLog::Entry errorLine(const std::string& text) {
+    return RecordingLog::unifiedLine(LogLevel::error, text);
+  }
+  // As the account's user may.
+  void plant(const char* statements) {
+    sqlite3* handle = nullptr;
+    ASSERT_EQ(::sqlite3_open(file.c_str(), &handle), SQLITE_OK);
+    EXPECT_EQ(::sqlite3_exec(handle, statements, nullptr, nullptr, nullptr), SQLITE_OK);
+    ::sqlite3_close(handle);
+  }
 };
 
 TEST_F(SqliteVoicemailStoreTest, ReadingMakesNothingAndWritingMakesAPrivateFileOfTheAccount) {
@@ -188,19 +210,137 @@ TEST_F(SqliteVoicemailStoreTest, ADamagedStoreIsMovedAsideAndANewOneMade) {
   store.setTokenForKey("key", "value");
   EXPECT_EQ(store.copyTokenForKey("key"), "value");
   EXPECT_EQ(contentOf(file + ".damaged"), std::string(8192, 'x'));
+  EXPECT_EQ(log.entries(), (std::vector{errorLine("The voicemail store could not be read"),
+                                        errorLine("The voicemail store is damaged; moved aside to "
+                                                  "voicemail.db.damaged")}));
+}
+
+TEST_F(SqliteVoicemailStoreTest, ASecondDamageGetsANameOfItsOwnAndNothingIsWrittenOver) {
+  home.directory("Library/Voicemail");
+  RecordingLog log;
+  std::vector<RecordingLog::Entry> lines;
+  const std::vector<std::string> names{"voicemail.db.damaged", "voicemail.db.damaged.1",
+                                       "voicemail.db.damaged.2"};
+  for (std::size_t i = 0; i < names.size(); ++i) {
+    home.file("Library/Voicemail/voicemail.db", std::string(8192, static_cast<char>('a' + i)));
+    store.setToken(&token);
+    EXPECT_EQ(store.copyToken(), token);
+    lines.push_back(errorLine("The voicemail store is damaged; moved aside to " + names[i]));
+  }
+  for (std::size_t i = 0; i < names.size(); ++i) {
+    EXPECT_EQ(contentOf(home / "Library/Voicemail/" + names[i]),
+              std::string(8192, static_cast<char>('a' + i)));
+  }
+  EXPECT_EQ(log.entries(), lines);
+}
+
+TEST_F(SqliteVoicemailStoreTest, WhereAllNamesForDamageAreTakenTheStoreIsLeftAlone) {
+  home.file("Library/Voicemail/voicemail.db.damaged", "kept");
+  for (int i = 1; i < 100; ++i) {
+    home.file("Library/Voicemail/voicemail.db.damaged." + std::to_string(i), "kept");
+  }
+  const std::string damaged(8192, 'x');
+  home.file("Library/Voicemail/voicemail.db", damaged);
+  RecordingLog log;
+  store.setToken(&token);
+  EXPECT_EQ(contentOf(file), damaged);
+  EXPECT_EQ(contentOf(file + ".damaged"), "kept");
+  EXPECT_EQ(contentOf(file + ".damaged.99"), "kept");
   EXPECT_EQ(log.entries(),
-            (std::vector{RecordingLog::unifiedLine(
-                LogLevel::error, "The voicemail store is damaged; moved aside to voicemail.db.damaged")}));
+            (std::vector{errorLine("The voicemail store is damaged and cannot be moved aside (File exists)"),
+                         errorLine("The voicemail store could not be written")}));
+}
+
+TEST_F(SqliteVoicemailStoreTest, AnAnsweredChangeIsHeldFastInItsFolder) {
+  store.setToken(&token);
+  // What SQLite does with names and folders, in order: with the journal's name gone, the folder is synced.
+  static std::vector<std::string> calls;
+  calls.clear();
+  sqlite3_vfs* const files = ::sqlite3_vfs_find(nullptr);
+  static const auto realUnlink =
+      reinterpret_cast<int (*)(const char*)>(files->xGetSystemCall(files, "unlink"));
+  static const auto realOpenDirectory =
+      reinterpret_cast<int (*)(const char*, int*)>(files->xGetSystemCall(files, "openDirectory"));
+  const auto unlink = +[](const char* path) {
+    calls.emplace_back("unlink");
+    return realUnlink(path);
+  };
+  const auto openDirectory = +[](const char* path, int* folder) {
+    calls.emplace_back("open folder to sync it");
+    return realOpenDirectory(path, folder);
+  };
+  files->xSetSystemCall(files, "unlink", reinterpret_cast<sqlite3_syscall_ptr>(unlink));
+  files->xSetSystemCall(files, "openDirectory", reinterpret_cast<sqlite3_syscall_ptr>(openDirectory));
+  store.setTokenForKey("key", "value");
+  files->xSetSystemCall(files, "unlink", nullptr);
+  files->xSetSystemCall(files, "openDirectory", nullptr);
+  ASSERT_FALSE(calls.empty());
+  EXPECT_EQ(std::count(calls.begin(), calls.end(), "unlink"), 1);
+  EXPECT_EQ(calls.back(), "open folder to sync it");
+}
+
+TEST_F(SqliteVoicemailStoreTest, AFolderThatCannotBeHeldFastIsNoPlaceForATokenAndIsMadeAgain) {
+  // Of the home, of the folder in it; then all is as usual.
+  for (const int earlier : {0, 1}) {
+    FailingCall fails("fsync", EIO, earlier);
+    RecordingLog log;
+    store.setToken(&token);
+    EXPECT_EQ(fails.failures(), 1);
+    EXPECT_EQ(log.entries(), std::vector{errorLine("The voicemail store could not be written")});
+    EXPECT_FALSE(isThere(home / "Library/Voicemail"));
+    std::filesystem::remove_all(home / "Library");
+  }
+  store.setToken(&token);
+  EXPECT_EQ(store.copyToken(), token);
+}
+
+TEST_F(SqliteVoicemailStoreTest, AnEndlessSearchIsCutOffAndTold) {
+  store.setToken(&token);
+  plant(
+      "DROP TABLE general; CREATE TABLE general(id, token);"
+      "WITH RECURSIVE n(i) AS (SELECT 1 UNION ALL SELECT i + 1 FROM n WHERE i < 100000) "
+      "INSERT INTO general SELECT i, 'x' FROM n;");
+  ManualSqliteTime time;
+  time.perLook = 1ms;
+  SqliteVoicemailStore limited(home.path(), ::getuid(), ::getgid(), time.asTime());
+  RecordingLog log;
+  EXPECT_EQ(limited.copyToken(), std::nullopt);
+  EXPECT_GT(time.now, SqliteVoicemailStore::kPatience);
+  EXPECT_LT(time.now, SqliteVoicemailStore::kPatience + 10ms);
+  EXPECT_EQ(log.entries(), std::vector{errorLine("The voicemail store could not be read")});
+}
+
+TEST_F(SqliteVoicemailStoreTest, AValueTooLongToBeATokenIsNotRead) {
+  store.setToken(&token);
+  plant("UPDATE general SET token = hex(zeroblob(50000))");
+  RecordingLog log;
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  EXPECT_EQ(log.entries(), std::vector{errorLine("The voicemail store could not be read")});
+}
+
+TEST_F(SqliteVoicemailStoreTest, AViewInATablesPlaceIsNotLookedThrough) {
+  store.setToken(&token);
+  plant("DROP TABLE general; CREATE VIEW general AS SELECT 0 AS id, 'planted' AS token");
+  RecordingLog log;
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+}
+
+TEST_F(SqliteVoicemailStoreTest, APipeInTheJournalsPlaceKeepsNobodyWaiting) {
+  store.setToken(&token);
+  ASSERT_EQ(::mkfifo((file + "-journal").c_str(), 0600), 0);
+  RecordingLog log;
+  const std::string other = "other";
+  store.setToken(&other);
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  EXPECT_EQ(log.entries(), (std::vector{errorLine("The voicemail store could not be written"),
+                                        errorLine("The voicemail store could not be read")}));
+  std::filesystem::remove(file + "-journal");
+  EXPECT_EQ(store.copyToken(), token);
 }
 
 TEST_F(SqliteVoicemailStoreTest, ATriggerPlantedByTheAccountsUserDoesNotRun) {
   store.setTokenForKey("a", "1");
-  sqlite3* handle = nullptr;
-  ASSERT_EQ(::sqlite3_open(file.c_str(), &handle), SQLITE_OK);
-  ASSERT_EQ(::sqlite3_exec(handle, "CREATE TRIGGER t AFTER INSERT ON tokens BEGIN DELETE FROM tokens; END;",
-                           nullptr, nullptr, nullptr),
-            SQLITE_OK);
-  ::sqlite3_close(handle);
+  plant("CREATE TRIGGER t AFTER INSERT ON tokens BEGIN DELETE FROM tokens; END;");
   store.setTokenForKey("b", "2");
   EXPECT_EQ(store.copyTokenForKey("a"), "1");
   EXPECT_EQ(store.copyTokenForKey("b"), "2");
@@ -208,19 +348,29 @@ TEST_F(SqliteVoicemailStoreTest, ATriggerPlantedByTheAccountsUserDoesNotRun) {
 
 TEST_F(SqliteVoicemailStoreTest, AStoreThatAnotherProcessHoldsDropsTheWriteAfterASecondAndStaysSound) {
   store.setToken(&token);
+  store.setTokenForKey("key", "value");
   sqlite3* handle = nullptr;
   ASSERT_EQ(::sqlite3_open(file.c_str(), &handle), SQLITE_OK);
   ASSERT_EQ(::sqlite3_exec(handle, "BEGIN EXCLUSIVE", nullptr, nullptr, nullptr), SQLITE_OK);
+  ManualSqliteTime time;
+  SqliteVoicemailStore limited(home.path(), ::getuid(), ::getgid(), time.asTime());
   RecordingLog log;
   const std::string other = "other";
-  const auto start = std::chrono::steady_clock::now();
-  store.setToken(&other);
-  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(30));
-  EXPECT_EQ(
-      log.entries(),
-      (std::vector{RecordingLog::unifiedLine(LogLevel::error, "The voicemail store could not be written")}));
+  limited.setToken(&other);
+  EXPECT_EQ(time.slept, 1s);
+  EXPECT_EQ(log.entries(), std::vector{errorLine("The voicemail store could not be written")});
+  log.clear();
+  EXPECT_EQ(limited.copyToken(), std::nullopt);
+  EXPECT_EQ(time.slept, 2s);
+  EXPECT_EQ(log.entries(), std::vector{errorLine("The voicemail store could not be read")});
+  // A reset is two operations, and waits no longer than a request may.
+  time.slept = 0s;
+  limited.setToken(nullptr);
+  limited.removeAllRecords();
+  EXPECT_EQ(time.slept, 2s);
   ::sqlite3_close(handle);
   EXPECT_EQ(store.copyToken(), token);
+  EXPECT_EQ(store.copyTokenForKey("key"), "value");
 }
 
 TEST_F(SqliteVoicemailStoreTest, OnAFullDiskTheOldTokenIsStillRead) {
@@ -343,10 +493,10 @@ TEST_F(SqliteVoicemailStoreTest, WhereItMayNotWriteTheOldTokenStaysAndTheFailure
     store.setTokenForKey("key", other);
     store.setToken(nullptr);
     store.removeAllRecords();
+    EXPECT_EQ(log.entries(), std::vector(4, errorLine("The voicemail store could not be written")));
+    log.clear();
     EXPECT_EQ(store.copyToken(), std::nullopt);
-    EXPECT_EQ(log.entries(),
-              std::vector(
-                  4, RecordingLog::unifiedLine(LogLevel::error, "The voicemail store could not be written")));
+    EXPECT_EQ(log.entries(), std::vector{errorLine("The voicemail store could not be read")});
     std::fflush(nullptr);
     ::_exit(testing::Test::HasFailure() ? 1 : 0);
   }
