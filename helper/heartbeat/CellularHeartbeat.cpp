@@ -17,6 +17,7 @@
 
 #include "helper/heartbeat/EchoMessage.h"
 #include "platform/base/Utf8.h"
+#include "platform/log/Log.h"
 
 namespace brenvik {
 namespace {
@@ -66,15 +67,19 @@ void CellularHeartbeat::setHeartbeat(ServerContext& server, bool enable) {
 void CellularHeartbeat::start(ServerContext& server) {
   server_ = &server;
   timer_.reset();
-  timer_ = queue_->makeTimer(0s, kInterval, kLeeway, [this] { (void)ping(); });  // told nobody, by design
-  (void)ping();                                                                  // likewise
-  busyToken_ = AcquireBusyToken(server);
+  bool isArmed = false;
   try {
-    if (timer_ != nullptr) timer_->activate();
-  } catch (const std::bad_alloc&) {
-    stop(server);  // a helper that only seems to be kept by a heartbeat would never leave
-    throw;
+    timer_ = queue_->makeTimer(0s, kInterval, kLeeway, [this] { (void)ping(); });  // told nobody, by design
+    (void)ping();                                                                  // likewise
+    if (timer_ != nullptr) {
+      busyToken_ = AcquireBusyToken(server);
+      isArmed = timer_->activate();
+    }
+  } catch (const std::bad_alloc&) {  // as below
   }
+  if (isArmed) return;
+  logUnified(LogLevel::error, "The cellular heartbeat is off: its timer cannot be armed");
+  stop(server);  // a helper that only seems to be kept by a heartbeat would never leave
 }
 
 void CellularHeartbeat::stop(ServerContext& server) {

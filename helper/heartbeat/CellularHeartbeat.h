@@ -39,7 +39,8 @@ class CellularHeartbeat {
   void configure(Parts parts);
 
   // Switches it on or off, and returns at once. Main loop only; a server that was switched on for outlives
-  // the heartbeat. Switched on twice, it takes a second token and forgets the first, which stays taken.
+  // the heartbeat. Switched on twice, it takes a second token and forgets the first, which stays taken. Where
+  // its timer cannot be armed it is off again, its token is given back, and a line says so.
   void setHeartbeat(ServerContext& server, bool enable);
 
   // Ends the queue after the probe that runs, which takes up to two seconds; tokens stay taken. Main loop

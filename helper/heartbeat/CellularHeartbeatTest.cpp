@@ -20,6 +20,8 @@ namespace {
 
 using namespace std::chrono_literals;
 
+using Lines = std::vector<RecordingLog::Entry>;
+
 std::uint16_t ourIdentifier() { return static_cast<std::uint16_t>(::getpid() & 0xFFFF); }
 
 std::vector<std::byte> echoReply(std::uint16_t identifier) {
@@ -281,6 +283,44 @@ TEST_F(CellularHeartbeatTest, StartedTwiceTheFirstTokenStaysHeld) {
   heartbeat.setHeartbeat(server, false);
   runQueue();
   EXPECT_EQ(server.busyMask, 1U) << "a second stop has only token 0 to give";
+}
+
+TEST_F(CellularHeartbeatTest, WithoutATimerThatCanBeMadeOrArmedItIsOffAndHoldsNoToken) {
+  const Lines off{
+      RecordingLog::unifiedLine(LogLevel::error, "The cellular heartbeat is off: its timer cannot be armed")};
+  for (const auto timers : {ManualWorkQueue::Timers::cannotBeMade, ManualWorkQueue::Timers::cannotBeArmed}) {
+    log.clear();
+    heartbeat.setHeartbeat(server, true);
+    queues.serial.at(0)->timers = timers;
+    runQueue();
+    EXPECT_EQ(server.busyMask, 0U);
+    EXPECT_EQ(log.entries(), off);
+    const auto probes = network.sent.size();
+    advance(8s);
+    EXPECT_EQ(network.sent.size(), probes);
+  }
+  EXPECT_TRUE(idleTimerRuns());
+  queues.serial[0]->timers = ManualWorkQueue::Timers::work;
+  heartbeat.setHeartbeat(server, true);
+  runQueue();
+  EXPECT_EQ(server.busyMask, 1U);
+}
+
+TEST_F(CellularHeartbeatTest, ARunningHeartbeatWhoseNewTimerCannotBeMadeGivesItsTokenBackToo) {
+  heartbeat.setHeartbeat(server, true);
+  runQueue();
+  ASSERT_EQ(server.busyMask, 1U);
+  queues.serial[0]->timers = ManualWorkQueue::Timers::cannotBeMade;
+  heartbeat.setHeartbeat(server, true);
+  runQueue();
+  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(log.entries().size(), 1U);
+}
+
+TEST_F(CellularHeartbeatTest, ItsTicksMayBePutOffByFiveMicrosecondsAtMost) {
+  heartbeat.setHeartbeat(server, true);
+  runQueue();
+  EXPECT_EQ(queues.serial.at(0)->leeways, std::vector<std::chrono::nanoseconds>{5'000ns});
 }
 
 TEST_F(CellularHeartbeatTest, StopWithoutAPriorStartReleasesToken0WhichIsRefused) {

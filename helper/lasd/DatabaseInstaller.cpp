@@ -97,10 +97,12 @@ bool DatabaseInstaller::downloadAndInstall(const std::string& url, std::int32_t 
   }
   syncDirectory(parts_.directory);
 
-  if (!recordVersion(type, record)) return false;
+  // Before the record, and not after it: a lack of memory must not make a failure of what has been done.
   const PropertyList version = record.find(kVersionKey);
+  const std::string versionText(version.asString().value_or("(null)"));
+  if (!recordVersion(type, record)) return false;
   logUnified(LogLevel::info, "Downloaded %s database version %s successfully", nameOfDatabaseType(type),
-             std::string(version.asString().value_or("(null)")).c_str());
+             versionText.c_str());
   return true;
 }
 

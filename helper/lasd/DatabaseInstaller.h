@@ -27,8 +27,8 @@ class DatabaseInstaller {
 
   // Downloads the gzip file, never over cellular, puts it uncompressed in place of an older one, and then
   // stores `record` as the type's version record. True when both are done. A failure on the way leaves the
-  // older record, so that the next check tries again. The previous file is removed before the new one is
-  // moved in, so that for a moment there is none.
+  // older record, so that the next check tries again, unless the server has gone back to that version by
+  // then. The previous file is removed before the new one is moved in, so that for a moment there is none.
   bool downloadAndInstall(const std::string& url, std::int32_t type, const PropertyList& record);
 
  private:

@@ -199,7 +199,7 @@ TEST_F(DatabaseInstallerTest, AFailedRenameSaysWhyAndKeepsTheTemporaryFile) {
     const std::string path_;
   } thief(at("gsm.db.tmp"));
   serveGzip(kUrl, "newer");
-  DatabaseInstaller installer({{queues, web, thief, 0}, preferences, directory});
+  DatabaseInstaller installer({{queues, web, thief, roomyDisk}, preferences, directory});
   EXPECT_FALSE(installer.downloadAndInstall(kUrl, gsm, record));
   EXPECT_EQ(log.entries().back(), error("Could not rename " + at("gsm.db.tmp") + " to " + at("gsm.db") +
                                         ": No such file or directory"));

@@ -69,20 +69,26 @@ bool writeAll(int file, std::span<const std::byte> bytes) {
   return true;
 }
 
-// How much may be written to the disk of the file; nothing when that cannot be told.
-std::uint64_t roomFor(int file, std::uint64_t reserve) {
-  struct statvfs disk {};
-  if (::fstatvfs(file, &disk) != 0) return 0;
-  const std::uint64_t free = std::uint64_t{disk.f_bavail} * disk.f_frsize;
-  return free > reserve ? free - reserve : 0;
+void tellWriteError(const std::string& path) {
+  logUnified(LogLevel::error, "Cannot write output file %s: %s", path.c_str(), std::strerror(errno));
 }
 
+// What does not fit is unpacked so far all the same, to nowhere, so that somebody can be told how much room
+// it needs. A few seconds of work; a bomb ends there.
+constexpr std::uint64_t kMostCountedBeyondRoom = std::uint64_t{1} << 30;
+
 }  // namespace
+
+DiskSpace diskSpaceOf(int file) noexcept {
+  struct statvfs disk {};
+  if (::fstatvfs(file, &disk) != 0) return {};
+  return {std::uint64_t{disk.f_blocks} * disk.f_frsize, std::uint64_t{disk.f_bavail} * disk.f_frsize};
+}
 
 HttpFetcher::HttpFetcher(const Parts& parts)
     : parts_(parts), queue_(parts.queues.makeSerial(kQueueLabel, QualityOfService::utility)) {}
 
-bool HttpFetcher::fetch(const std::string& url, WifiOnly wifiOnly) noexcept try {
+bool HttpFetcher::fetch(const std::string& url, WifiOnly wifiOnly, std::uint64_t largestBody) noexcept try {
   body_.clear();
   headers_.clear();
   if (url.empty()) {
@@ -101,6 +107,7 @@ bool HttpFetcher::fetch(const std::string& url, WifiOnly wifiOnly) noexcept try 
     return false;
   }
   const auto semaphore = std::make_shared<Semaphore>();
+  request->setLargestBody(largestBody);
   request->setCallbackQueue(queue_);
   request->setCompletion([this, url, semaphore](const std::shared_ptr<WebResponse>& response) {
     completed(url, response);
@@ -153,8 +160,10 @@ bool HttpFetcher::uncompressTo(const std::string& path) {
   }
   // Some errors of a disk show only when what was written has to get there. The version record that follows
   // is written for good, so the database must be before it.
-  const bool ok = uncompressInto(file.get()) && ::fsync(file.get()) == 0 && ::close(file.release()) == 0;
-  if (ok) return true;
+  if (uncompressInto(file.get(), path)) {
+    if (::fsync(file.get()) == 0 && ::close(file.release()) == 0) return true;
+    tellWriteError(path);
+  }
   logUnified(LogLevel::error, "Could not uncompress HTTP response to %s!", path.c_str());
   file.reset();
   if (::remove(path.c_str()) != 0) {
@@ -164,11 +173,26 @@ bool HttpFetcher::uncompressTo(const std::string& path) {
   return false;
 }
 
-bool HttpFetcher::uncompressInto(int file) {
-  const auto result =
-      parts_.gunzip.gunzip(body_, roomFor(file, parts_.diskReserve),
-                           [file](std::span<const std::byte> output) { return writeAll(file, output); });
-  return result == GunzipResult::whole;
+bool HttpFetcher::uncompressInto(int file, const std::string& path) {
+  const DiskSpace disk = parts_.diskSpace(file);
+  const std::uint64_t reserve = diskReserve(disk.size);
+  const std::uint64_t room = disk.available > reserve ? disk.available - reserve : 0;
+  std::uint64_t need = 0;
+  const auto receive = [&](std::span<const std::byte> output) {
+    need += output.size();
+    if (need > room || writeAll(file, output)) return true;
+    tellWriteError(path);
+    return false;
+  };
+  const auto result = parts_.gunzip.gunzip(body_, room + kMostCountedBeyondRoom, receive);
+  if (need <= room) return result == GunzipResult::whole;
+  // Of a file that turns out to be damaged nobody knows how much room it needs.
+  if (result == GunzipResult::whole || result == GunzipResult::tooLarge) {
+    logUnified(LogLevel::error,
+               "No room for %s: it needs %llu bytes or more, %llu are free beyond the reserve", path.c_str(),
+               static_cast<unsigned long long>(need), static_cast<unsigned long long>(room));
+  }
+  return false;
 }
 
 }  // namespace brenvik

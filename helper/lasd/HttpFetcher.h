@@ -2,8 +2,10 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <algorithm>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <span>
 #include <string>
@@ -14,8 +16,19 @@
 
 namespace brenvik {
 
-// Disk space that unpacking leaves free, in bytes: other programs keep their state on the same disk.
-inline constexpr std::uint64_t kDiskReserve = std::uint64_t{16} << 20;
+// A file system, in bytes.
+struct DiskSpace {
+  std::uint64_t size = 0;
+  std::uint64_t available = 0;
+};
+// The one that an open file stands on; nothing is available where that cannot be told.
+DiskSpace diskSpaceOf(int file) noexcept;
+
+// What unpacking leaves free of a file system of this size: other programs keep their state there. 16 MiB,
+// and of a small one 2 %, or nothing would ever be installed there.
+constexpr std::uint64_t diskReserve(std::uint64_t size) noexcept {
+  return std::min(std::uint64_t{16} << 20, size / 50);
+}
 
 enum class WifiOnly : bool { no, yes };
 
@@ -28,7 +41,7 @@ class HttpFetcher {
     WorkQueues& queues;
     WebClient& web;
     Gunzip& gunzip;
-    std::uint64_t diskReserve = kDiskReserve;
+    std::function<DiskSpace(int file)> diskSpace = diskSpaceOf;
   };
 
   explicit HttpFetcher(const Parts& parts);
@@ -36,8 +49,9 @@ class HttpFetcher {
   HttpFetcher& operator=(const HttpFetcher&) = delete;
 
   // Blocks until the HTTP client reports, without a limit of its own. True when a body came that is not
-  // empty. Fails at once on this object's own queue, which it would block.
-  bool fetch(const std::string& url, WifiOnly wifiOnly) noexcept;
+  // empty; one of more than `largestBody` bytes is a failure. Fails at once on this object's own queue, which
+  // it would block.
+  bool fetch(const std::string& url, WifiOnly wifiOnly, std::uint64_t largestBody = kLargestWebBody) noexcept;
 
   // Writes the body, which must have been delivered as a gzip file, uncompressed to the path. The file is on
   // the disk when this returns true; when it returns false, there is none.
@@ -48,7 +62,7 @@ class HttpFetcher {
 
  private:
   void completed(const std::string& url, const std::shared_ptr<WebResponse>& response);
-  bool uncompressInto(int file);
+  bool uncompressInto(int file, const std::string& path);
 
   const Parts parts_;
   const std::shared_ptr<WorkQueue> queue_;

@@ -2,14 +2,18 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "helper/lasd/HttpFetcher.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 
 #include <atomic>
+#include <csignal>
 #include <future>
 #include <thread>
 
 #include "helper/lasd/LasdTestSupport.h"
+#include "platform/base/UniqueFd.h"
 
 namespace brenvik {
 namespace {
@@ -25,9 +29,9 @@ class HttpFetcherTest : public LasdTest {
   }
   // A fetcher that has this body, served with these headers.
   std::unique_ptr<HttpFetcher> fetched(const std::string& body, HeaderMap headers,
-                                       std::uint64_t diskReserve = 0) {
+                                       std::function<DiskSpace(int)> diskSpace = roomyDisk) {
     web.answer(kUrl, 200, body, std::move(headers));
-    auto fetcher = std::make_unique<HttpFetcher>(fetcherParts(diskReserve));
+    auto fetcher = std::make_unique<HttpFetcher>(fetcherParts(std::move(diskSpace)));
     EXPECT_TRUE(fetcher->fetch(kUrl, WifiOnly::yes));
     log.clear();
     return fetcher;
@@ -55,6 +59,7 @@ TEST_F(HttpFetcherTest, ABodyIsFetchedAndLoggedOnAUtilityQueueOfItsOwn) {
   EXPECT_EQ(seen.queueLabel, "com.norvale.httpdownloadqueue");
   EXPECT_EQ(seen.bodySize, 0U);
   EXPECT_EQ(seen.timeLimit.count(), 0) << "no limit beside the client's own";
+  EXPECT_EQ(seen.largestBody, kLargestWebBody);
 }
 
 TEST_F(HttpFetcherTest, CellularStaysAllowedUnlessTheFetchIsWifiOnly) {
@@ -174,7 +179,7 @@ TEST_F(HttpFetcherTest, OnItsOwnQueueAFetchFailsAtOnce) {
   web.answer(kUrl, 200, "body");
   std::promise<bool> result;
   one.queue->post([&] {
-    HttpFetcher fetcher({one, web, gunzip, 0});
+    HttpFetcher fetcher({one, web, gunzip, roomyDisk});
     result.set_value(fetcher.fetch(kUrl, WifiOnly::yes));
   });
   EXPECT_FALSE(result.get_future().get());
@@ -294,7 +299,7 @@ TEST_F(HttpFetcherTest, APartialFileThatCannotBeRemovedIsTold) {
     const std::string path_;
   } thief(path());
   web.answer(kUrl, 200, "x", gzipType);
-  HttpFetcher fetcher({queues, web, thief, 0});
+  HttpFetcher fetcher({queues, web, thief, roomyDisk});
   ASSERT_TRUE(fetcher.fetch(kUrl, WifiOnly::yes));
   log.clear();
   EXPECT_FALSE(fetcher.uncompressTo(path()));
@@ -303,10 +308,70 @@ TEST_F(HttpFetcherTest, APartialFileThatCannotBeRemovedIsTold) {
                                         ": No such file or directory")}));
 }
 
-TEST_F(HttpFetcherTest, ABombStopsBeforeTheReserveOfTheDiskIsTouched) {
-  const auto fetcher = fetched(gzipOf(std::string(1000, 'x')), gzipType, ~std::uint64_t{0} / 2);
-  EXPECT_FALSE(fetcher->uncompressTo(path()));
+TEST_F(HttpFetcherTest, ALimitOnTheBodyIsTheRequests) {
+  web.answer(kUrl, 200, "body");
+  HttpFetcher fetcher(fetcherParts());
+  EXPECT_TRUE(fetcher.fetch(kUrl, WifiOnly::yes, 1000));
+  EXPECT_EQ(web.seen().at(0).largestBody, 1000U);
+}
+
+TEST_F(HttpFetcherTest, TheReserveOfASmallDiskIsSmall) {
+  EXPECT_EQ(diskReserve(std::uint64_t{1} << 40), std::uint64_t{16} << 20);
+  EXPECT_EQ(diskReserve(std::uint64_t{800} << 20), std::uint64_t{16} << 20);
+  EXPECT_EQ(diskReserve(std::uint64_t{799} << 20), (std::uint64_t{799} << 20) / 50);
+  EXPECT_EQ(diskReserve(8 << 20), (8U << 20) / 50);
+  EXPECT_EQ(diskReserve(0), 0U);
+}
+
+TEST_F(HttpFetcherTest, TheRealDiskHasASizeAndWhatIsNoFileHasNothing) {
+  const UniqueFd file(::open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const DiskSpace disk = diskSpaceOf(file.get());
+  EXPECT_GT(disk.size, 0U);
+  EXPECT_LE(disk.available, disk.size);
+  EXPECT_EQ(diskSpaceOf(-1).size, 0U);
+  EXPECT_EQ(diskSpaceOf(-1).available, 0U);
+}
+
+TEST_F(HttpFetcherTest, WhatDoesNotFitBesideTheReserveIsToldWithPathNeedAndRoom) {
+  // 50,000 bytes have a reserve of 1,000.
+  const auto disk = [](int) { return DiskSpace{50'000, 11'000}; };
+  EXPECT_TRUE(fetched(gzipOf(std::string(10'000, 'x')), gzipType, disk)->uncompressTo(path()));
+  EXPECT_FALSE(fetched(gzipOf(std::string(10'001, 'x')), gzipType, disk)->uncompressTo(path()));
+  EXPECT_EQ(log.entries(), (Lines{error("No room for " + path() +
+                                        ": it needs 10001 bytes or more, 10000 are free beyond the reserve"),
+                                  error("Could not uncompress HTTP response to " + path() + "!")}));
+  EXPECT_FALSE(std::filesystem::exists(path()));
+}
+
+TEST_F(HttpFetcherTest, ADiskWithoutRoomBesideTheReserveTakesNothing) {
+  const auto disk = [](int) { return DiskSpace{50'000, 999}; };
+  EXPECT_FALSE(fetched(gzipOf("x"), gzipType, disk)->uncompressTo(path()));
+  EXPECT_EQ(log.entries().at(0).line,
+            "No room for " + path() + ": it needs 1 bytes or more, 0 are free beyond the reserve");
+}
+
+TEST_F(HttpFetcherTest, OfADamagedFileThatDoesNotFitNoNeedIsTold) {
+  const auto disk = [](int) { return DiskSpace{50'000, 11'000}; };
+  std::string damaged = gzipOf(std::string(100'000, 'x'));
+  damaged[damaged.size() - 8] ^= 1;
+  EXPECT_FALSE(fetched(damaged, gzipType, disk)->uncompressTo(path()));
   EXPECT_EQ(log.entries(), Lines{error("Could not uncompress HTTP response to " + path() + "!")});
+  EXPECT_FALSE(std::filesystem::exists(path()));
+}
+
+TEST_F(HttpFetcherTest, AWriteThatFailsIsToldWithItsReason) {
+  const auto fetcher = fetched(gzipOf(std::string(100'000, 'x')), gzipType);
+  struct rlimit before {};
+  ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &before), 0);
+  const auto signalBefore = std::signal(SIGXFSZ, SIG_IGN);
+  const struct rlimit small { 1000, before.rlim_max };
+  ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &small), 0);
+  const bool isWritten = fetcher->uncompressTo(path());
+  ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &before), 0);
+  (void)std::signal(SIGXFSZ, signalBefore);
+  EXPECT_FALSE(isWritten);
+  EXPECT_EQ(log.entries(), (Lines{error("Cannot write output file " + path() + ": File too large"),
+                                  error("Could not uncompress HTTP response to " + path() + "!")}));
   EXPECT_FALSE(std::filesystem::exists(path()));
 }
 

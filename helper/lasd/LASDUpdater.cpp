@@ -3,11 +3,12 @@
 #include "helper/lasd/LASDUpdater.h"
 
 #include <exception>
+#include <new>
+#include <span>
 #include <string_view>
 #include <utility>
 
 #include "helper/lasd/DatabaseTypes.h"
-#include "helper/lasd/Notifications.h"
 #include "helper/lasd/VersionText.h"
 #include "platform/log/Log.h"
 #include "platform/plist/PropertyListCodec.h"
@@ -44,6 +45,20 @@ class HeldToken {
   const std::uint32_t token_;
 };
 
+// A value taken out of a document keeps all of that document; this one has its own memory.
+PropertyList ownCopy(const PropertyList& value) {
+  CodecFailure failure{};
+  const auto bytes = serializePropertyList(value, PropertyListFormat::binary, &failure);
+  PropertyList copy;
+  if (bytes) copy = parsePropertyList(std::as_bytes(std::span(*bytes)), &failure);
+  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
+  return copy ? copy : value;
+}
+
+void giveUp(std::int32_t type) noexcept {
+  logUnified(LogLevel::error, "Update of the %s database given up: out of memory", nameOfDatabaseType(type));
+}
+
 // For a log line.
 std::string shown(const PropertyList& string) {
   return std::string(string ? textOf(string) : std::string_view("(null)"));
@@ -76,6 +91,7 @@ void LASDUpdater::checkForUpdate(ServerContext& server, std::uint32_t mask) {
         self->check(server, mask);
       } catch (...) {  // what is called here throws for no other reason
         logUnified(LogLevel::error, "Update check given up: out of memory");
+        self->tell(NotificationKind::updateFailed, 0);
       }
     });
   } catch (...) {
@@ -85,20 +101,29 @@ void LASDUpdater::checkForUpdate(ServerContext& server, std::uint32_t mask) {
 }
 
 void LASDUpdater::check(ServerContext& server, std::uint32_t mask) {
+  outOfMemory_ = 0;
   loadVersions(kVersionsDomain, VersionSource::preferences, mask);
   const std::int64_t result = loadVersions(parts_->manifestUrl, VersionSource::manifest, mask);
-  if (result != 0 && result != kNotFetched) {
-    for (const std::int32_t type : kDatabaseTypesInOrder) {
-      if ((result & type) == 0) continue;
+  if (result == kNotFetched) return tell(NotificationKind::updateFailed, 0);
+  if (result == 0 && outOfMemory_ == 0) {
+    logUnified(LogLevel::error, "No update required for any databases");
+    return tell(NotificationKind::noUpdateRequired, 0);
+  }
+  for (const std::int32_t type : kDatabaseTypesInOrder) {
+    if ((outOfMemory_ & type) != 0) {
+      giveUp(type);
+      tell(NotificationKind::updateFailed, type);
+    } else if ((result & type) != 0) {
       const HeldToken own(server);
       updateDatabase(type);
     }
-  } else if (result == 0) {
-    logUnified(LogLevel::error, "No update required for any databases");
-    sendNotification(parts_->messagePorts, makeNotification(NotificationKind::noUpdateRequired, 0));
-  } else {
-    sendNotification(parts_->messagePorts, makeNotification(NotificationKind::updateFailed, 0));
   }
+}
+
+void LASDUpdater::tell(NotificationKind kind, std::int32_t type) noexcept try {
+  sendNotification(parts_->messagePorts, makeNotification(kind, type));
+} catch (...) {
+  // No memory for it: dropped, as any notification that cannot be sent.
 }
 
 std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource kind, std::uint32_t mask) {
@@ -106,18 +131,23 @@ std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource 
     logUnified(LogLevel::info, "Reading local resource %s", source.c_str());
     for (const std::int32_t type : kDatabaseTypesInOrder) {
       if ((mask & static_cast<std::uint32_t>(type)) == 0) continue;
-      PropertyList record;
-      if (!parts_->preferences.readValue(keyOfDatabaseType(type), source, UserScope::currentUser,
-                                         HostScope::anyHost, &record)) {
-        throw std::bad_alloc();
+      try {
+        PropertyList record;
+        if (!parts_->preferences.readValue(keyOfDatabaseType(type), source, UserScope::currentUser,
+                                           HostScope::anyHost, &record)) {
+          throw std::bad_alloc();
+        }
+        versions_[type] = onlyDictionary(std::move(record));
+      } catch (const std::bad_alloc&) {
+        versions_.erase(type);  // an earlier check's entry would be taken for the present one
+        outOfMemory_ |= type;
       }
-      versions_[type] = onlyDictionary(std::move(record));
     }
     return 0;
   }
 
-  HttpFetcher fetcher({parts_->queues, parts_->web, parts_->gunzip, parts_->diskReserve});
-  if (!fetcher.fetch(source, WifiOnly::yes)) {
+  HttpFetcher fetcher({parts_->queues, parts_->web, parts_->gunzip, parts_->diskSpace});
+  if (!fetcher.fetch(source, WifiOnly::yes, kLargestManifest)) {
     logUnified(LogLevel::error, "Could not fetch data from source %s", source.c_str());
     return kNotFetched;
   }
@@ -135,11 +165,15 @@ std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource 
 std::int64_t LASDUpdater::compareWithManifest(const PropertyList& manifest, std::uint32_t mask) {
   std::int64_t result = 0;
   for (auto& [type, record] : versions_) {
-    if ((static_cast<std::uint32_t>(type) & mask) == 0 || isUpToDate(manifest, type)) continue;
-    const PropertyList serverEntry = onlyDictionary(manifest.find(nameOfDatabaseType(type)));
-    if (!serverEntry) continue;
-    record = serverEntry;
-    result |= type;
+    try {
+      if ((static_cast<std::uint32_t>(type) & mask) == 0 || isUpToDate(manifest, type)) continue;
+      const PropertyList serverEntry = onlyDictionary(manifest.find(nameOfDatabaseType(type)));
+      if (!serverEntry) continue;
+      record = ownCopy(serverEntry);
+      result |= type;
+    } catch (const std::bad_alloc&) {
+      outOfMemory_ |= type;
+    }
   }
   return result;
 }
@@ -183,13 +217,16 @@ void LASDUpdater::updateDatabase(std::int32_t type) {
     logUnified(LogLevel::error, "URL for %s database is empty", name);
     return;
   }
-  DatabaseInstaller installer({{parts_->queues, parts_->web, parts_->gunzip, parts_->diskReserve},
-                               parts_->preferences,
-                               parts_->directory});
-  const bool ok = installer.downloadAndInstall(std::string(textOf(url)), type, record);
-  sendNotification(
-      parts_->messagePorts,
-      makeNotification(ok ? NotificationKind::updateAvailable : NotificationKind::updateFailed, type));
+  bool ok = false;
+  try {
+    DatabaseInstaller installer({{parts_->queues, parts_->web, parts_->gunzip, parts_->diskSpace},
+                                 parts_->preferences,
+                                 parts_->directory});
+    ok = installer.downloadAndInstall(std::string(textOf(url)), type, record);
+  } catch (const std::bad_alloc&) {
+    giveUp(type);
+  }
+  tell(ok ? NotificationKind::updateAvailable : NotificationKind::updateFailed, type);
 }
 
 }  // namespace brenvik

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <memory>
 #include <string>
@@ -10,12 +11,16 @@
 #include "Helper/Shared/Server/BusyTokens.h"
 #include "helper/lasd/DatabaseInstaller.h"
 #include "helper/lasd/HttpFetcher.h"
+#include "helper/lasd/Notifications.h"
 #include "platform/messageport/MessagePort.h"
 #include "platform/plist/PropertyList.h"
 #include "platform/preferences/PreferencesStore.h"
 #include "platform/runloop/WorkQueue.h"
 
 namespace brenvik {
+
+// What a manifest may have at most; one of five entries has a kilobyte or two.
+inline constexpr std::uint64_t kLargestManifest = std::uint64_t{16} << 20;
 
 // Where the compiled-in update server keeps the manifest.
 extern const char* const kManifestUrl;
@@ -34,7 +39,7 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
     MessagePorts& messagePorts;
     std::string manifestUrl = kManifestUrl;
     std::string directory = kDatabaseDirectory;
-    std::uint64_t diskReserve = kDiskReserve;
+    std::function<DiskSpace(int file)> diskSpace = diskSpaceOf;
   };
   enum class VersionSource { preferences, manifest };
   // loadVersions() could not fetch the manifest; as a mask, no set of types is that large.
@@ -52,8 +57,9 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
   void configure(const Parts& parts);
 
   // Starts a check of the types in the mask and returns at once; other bits are ignored. Holds a busy token
-  // until the check's last notification is sent. Main loop only; the server outlives the check. Ends the
-  // process when the updater is on its way out.
+  // until the check's last notification is sent. A type for which memory runs out has failed, and the next
+  // one has its turn. Main loop only; the server outlives the check. Ends the process when the updater is on
+  // its way out.
   void checkForUpdate(ServerContext& server, std::uint32_t mask);
 
   // Ends the queue after the check that runs, which may wait for the HTTP client. Main loop only.
@@ -63,9 +69,11 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
 
   // Reads the version records of the types in the mask, from the preferences domain or by the manifest's URL.
   // Of the manifest: the mask of the types that need an update, whose entries are then the server's; 0 too
-  // when it is no manifest; kNotFetched. Of the preferences: 0.
+  // when it is no manifest; kNotFetched. Of the preferences: 0. Throws std::bad_alloc where memory does not
+  // suffice for the manifest.
   std::int64_t loadVersions(const std::string& source, VersionSource kind, std::uint32_t mask);
-  // The second half of the above: what of a manifest is new.
+  // The second half of the above: what of a manifest is new. Keeps copies, and nothing of the manifest
+  // itself.
   std::int64_t compareWithManifest(const PropertyList& manifest, std::uint32_t mask);
   bool isUpToDate(const PropertyList& manifest, std::int32_t type);
   // Has the type's database installed and tells what came of it.
@@ -73,10 +81,14 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
 
  private:
   void check(ServerContext& server, std::uint32_t mask);
+  // Drops what cannot be sent.
+  void tell(NotificationKind kind, std::int32_t type) noexcept;
 
   std::unique_ptr<Parts> parts_;
   // By type, the record found here or, once it needs an update, the server's; none when there is no record.
   std::map<std::int32_t, PropertyList> versions_;  // on the queue only
+  // The types of the present check for which memory did not suffice.
+  std::int64_t outOfMemory_ = 0;  // on the queue only
   // Last, so that it ends first: its tasks use everything above.
   std::shared_ptr<WorkQueue> queue_;
 };

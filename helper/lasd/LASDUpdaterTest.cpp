@@ -34,7 +34,7 @@ class LASDUpdaterTest : public LasdTest {
     LasdTest::SetUp();
     directory = folder / "LASD";
     server.runLoop = &loop;
-    updater->configure({queues, web, gunzip, preferences, messagePorts, kManifest, directory, 0});
+    updater->configure({queues, web, gunzip, preferences, messagePorts, kManifest, directory, roomyDisk});
   }
   void TearDown() override {
     updater->shutDown();
@@ -236,11 +236,64 @@ TEST_F(LASDUpdaterTest, AManifestThatCannotBeReadForLackOfMemoryIsNotTakenForNot
     EXPECT_EQ(server.busyMask, 0U) << number;
     if (shortLog.isGivenUp) {
       ++givenUp;
-      EXPECT_EQ(notifications().size(), before) << number;
+      ASSERT_EQ(notifications().size(), before + 1) << number;
+      EXPECT_EQ(notifications().back(), "UpdateFailed") << number;
     }
   }
   EXPECT_GT(givenUp, 10) << "five databases of several texts each";
   EXPECT_EQ(notifications().back(), "NoUpdateRequired");
+}
+
+TEST_F(LASDUpdaterTest, RecordsThatCannotBeReadForLackOfMemoryFailTheirDatabases) {
+  serveAll("1.0");
+  preferences.operationsWithMemory = 0;
+  check(gsm | umts);
+  EXPECT_EQ(notifications(), (std::vector<std::string>{"UpdateFailed", "UpdateFailed"}));
+  EXPECT_TRUE(logged(error("Update of the gsm database given up: out of memory")));
+  EXPECT_TRUE(logged(error("Update of the umts database given up: out of memory")));
+  EXPECT_FALSE(logged(error("No update required for any databases")));
+  EXPECT_EQ(fetched(), std::vector<std::string>{kManifest});
+  preferences.operationsWithMemory = -1;
+  check(gsm | umts);
+  ASSERT_EQ(notifications().size(), 4U);
+  EXPECT_EQ(notifications().back(), "UpdateAvailable umts");
+}
+
+TEST_F(LASDUpdaterTest, ADatabaseWithoutAQueueToFetchWithDoesNotEndTheCheck) {
+  serveAll("1.0");
+  queues.made.clear();
+  queues.refuseQueueAfter = 3;  // after the updater's own and the manifest's
+  check(gsm | lte);
+  EXPECT_EQ(notifications(), (std::vector<std::string>{"UpdateFailed", "UpdateAvailable lte"}));
+  EXPECT_TRUE(logged(error("Update of the gsm database given up: out of memory")));
+  EXPECT_EQ(server.busyMask, 0U);
+}
+
+TEST_F(LASDUpdaterTest, OfTheManifestOnlyTheEntryIsKept) {
+  const PropertyList manifest = *[] {
+    const std::string bytes = *serializePropertyList(
+        PropertyList::dictionary({{"lte", record("2", urlOf("lte"))},
+                                  {"filler", PropertyList::string(std::string(1'000'000, 'f'))}}),
+        PropertyListFormat::binary);
+    return std::make_unique<PropertyList>(parsePropertyList(std::as_bytes(std::span(bytes))));
+  }();
+  serveGzip(urlOf("lte"), "x");
+  updater->loadVersions("com.norvale.lasd", LASDUpdater::VersionSource::preferences, lte);
+  ASSERT_EQ(updater->compareWithManifest(manifest, lte), lte);
+  updater->updateDatabase(lte);
+  const PropertyList kept = local("lte");
+  EXPECT_EQ(kept, record("2", urlOf("lte")));
+  // What is kept as it came lies in the manifest's own memory.
+  EXPECT_NE(kept.find("Version").asString().value().data(),
+            manifest.find("lte").find("Version").asString().value().data());
+}
+
+TEST_F(LASDUpdaterTest, AManifestMayHave16MiBAndADatabaseWhatTheClientTakes) {
+  serveAll("1.0");
+  check(gsm);
+  ASSERT_EQ(web.seen().size(), 2U);
+  EXPECT_EQ(web.seen()[0].largestBody, std::uint64_t{16} << 20);
+  EXPECT_EQ(web.seen()[1].largestBody, kLargestWebBody);
 }
 
 TEST_F(LASDUpdaterTest, Mask0ReadsNoPreferenceAndStillFetchesTheManifest) {
@@ -410,7 +463,7 @@ TEST_F(LASDUpdaterTest, EachInstallHasABusyTokenOfItsOwn) {
    private:
     ServerContext& server_;
   } watching(server);
-  updater->configure({queues, web, gunzip, preferences, watching, kManifest, directory, 0});
+  updater->configure({queues, web, gunzip, preferences, watching, kManifest, directory, roomyDisk});
   serveAll("1.0");
   check(gsm | lte);
   EXPECT_EQ(watching.masks, (std::vector<std::uint32_t>{3, 3}));
@@ -430,7 +483,7 @@ TEST_F(LASDUpdaterTest, WithoutMemoryForARequestOrAQueueACheckFailsAndGivesItsTo
   queues.refuseQueues = true;
   check(kAll);
   EXPECT_TRUE(logged(error("Update check given up: out of memory")));
-  EXPECT_EQ(notifications().size(), 1U);
+  EXPECT_EQ(notifications(), (std::vector<std::string>{"UpdateFailed", "UpdateFailed"}));
   EXPECT_EQ(server.busyMask, 0U);
   queues.refuseQueues = false;
   check(gsm);
@@ -462,7 +515,7 @@ TEST_F(LASDUpdaterTest, AnUpdaterThatNobodyHoldsEndsTheProcess) {
   EXPECT_DEATH(
       {
         LASDUpdater unowned;
-        unowned.configure({queues, web, gunzip, preferences, messagePorts, kManifest, directory, 0});
+        unowned.configure({queues, web, gunzip, preferences, messagePorts, kManifest, directory, roomyDisk});
         unowned.checkForUpdate(server, gsm);
       },
       "");

@@ -49,7 +49,7 @@ class LasdTestQueues final : public WorkQueues {
   WorkQueue& main() noexcept override { return system_.main(); }
   WorkQueue& global() override { return system_.global(); }
   std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
-    if (refuseQueues) throw OutOfQueues();
+    if (refuseQueues || (refuseQueueAfter > 0 && --refuseQueueAfter == 0)) throw OutOfQueues();
     made.emplace_back(label, qualityOfService);
     if (label != "LASDUpdater") return system_.makeSerial(std::move(label), qualityOfService);
     updater = std::make_shared<ManualWorkQueue>(clock_, std::move(label), qualityOfService);
@@ -64,6 +64,7 @@ class LasdTestQueues final : public WorkQueues {
   std::vector<std::pair<std::string, QualityOfService>> made;
   std::shared_ptr<ManualWorkQueue> updater;
   bool refuseQueues = false;
+  int refuseQueueAfter = 0;  // 1: the next queue is refused, 2: the one after it ...; 0: none
 
  private:
   ManualClock clock_;
@@ -81,8 +82,10 @@ class LasdTest : public testing::Test {
   void TearDown() override {
     if (!folder.empty()) std::filesystem::remove_all(folder);
   }
-  HttpFetcher::Parts fetcherParts(std::uint64_t diskReserve = 0) {
-    return {queues, web, gunzip, diskReserve};
+  // Room for everything, whatever the disk of the machine has.
+  static DiskSpace roomyDisk(int) { return {std::uint64_t{1} << 40, std::uint64_t{1} << 40}; }
+  HttpFetcher::Parts fetcherParts(std::function<DiskSpace(int)> diskSpace = roomyDisk) {
+    return {queues, web, gunzip, std::move(diskSpace)};
   }
   void serveGzip(const std::string& url, const std::string& content) {
     web.answer(url, 200, gzipOf(content), {{"Content-Type", "application/gzip"}});

@@ -13,15 +13,7 @@ constexpr std::chrono::nanoseconds kGeoResponseTimeOut{5'000'000'000};
 
 }  // namespace
 
-void GeoRequests::dispatch(WorkQueue::Task workItem) {
-  // Made here, so that a queue that cannot be had ends the request and not what comes after it.
-  (void)geoCallbackQueue();
-  // By way of the main queue, which gets to it when the routine's reply has gone out: waking the other
-  // queue's thread can take longer than all the rest of the request, and the caller would wait for it.
-  queues_.main().post([self = shared_from_this(), workItem = std::move(workItem)]() mutable noexcept {
-    if (!self->closed_.load()) self->postToGeoCallbackQueue(std::move(workItem));
-  });
-}
+void GeoRequests::dispatch(WorkQueue::Task workItem) { postToGeoCallbackQueue(std::move(workItem)); }
 
 void GeoRequests::postToGeoCallbackQueue(WorkQueue::Task task) {
   geoCallbackQueue()->post([self = shared_from_this(), task = std::move(task)] {

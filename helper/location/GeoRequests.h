@@ -26,7 +26,8 @@ class GeoRequests : public std::enable_shared_from_this<GeoRequests> {
               GeoRequestState& state)
       : queues_(queues), geoService_(geoService), telephonyDaemon_(telephonyDaemon), state_(state) {}
 
-  // Has the work item of a request run on the GEO callback queue, unless closed by then. Main loop.
+  // Has the work item of a request run on the GEO callback queue, unless closed by then: at once, whatever
+  // the main loop does next. Main loop.
   void dispatch(WorkQueue::Task workItem);
 
   // Waits for the task that runs on the GEO callback queue; none starts afterwards. Main loop.

@@ -15,8 +15,8 @@
 
 namespace brenvik {
 
-// How urgent a queue's work is: `standard` leaves the thread as it is; `utility` gives it nice 10 and the
-// lowest best-effort I/O priority.
+// How urgent a queue's work is: `standard` gives the thread the priority of the process, whichever thread
+// starts it; `utility` gives it nice 10 and the lowest best-effort I/O priority.
 enum class QualityOfService { standard, utility };
 
 // A serial queue: tasks run one at a time, in the order posted. All members may be called from any thread

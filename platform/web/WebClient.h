@@ -15,8 +15,10 @@
 
 namespace brenvik {
 
-// The largest body a response may have, decoded, unless its request asks for less.
+// The largest body a response may have, as it travels and decoded, unless its request asks for less.
 inline constexpr std::uint64_t kLargestWebBody = std::uint64_t{512} << 20;
+// The same of a redirect, whose body nobody reads.
+inline constexpr std::uint64_t kLargestRedirectBody = std::uint64_t{64} << 10;
 
 // What several requests have in common. Set it up before the requests are sent.
 class WebSession {
@@ -40,10 +42,11 @@ class WebRequest {
   virtual void setCallbackQueue(std::shared_ptr<WorkQueue> queue) = 0;
   // Runs exactly once for each request that is sent, always, on the callback queue and never within send().
   virtual void setCompletion(Completion completion) = 0;
-  // From send() to the end of the body. Zero, as at first: no limit other than the client's own on
-  // connecting (30 s) and on stalling (under 200 bytes a second for 30 s).
+  // From send() to the end of the body, redirects included. Zero, as at first: no limit other than the
+  // client's own on connecting (30 s), on stalling (under 200 bytes a second for 30 s) and on the whole
+  // request (a minute, and a second for each 64 KiB of the largest body). The shortest limit counts.
   virtual void setTimeLimit(std::chrono::milliseconds limit) noexcept = 0;
-  // Bytes of the decoded body; kLargestWebBody at first, and at most.
+  // Bytes of the body, as it travels and decoded; kLargestWebBody at first, and at most.
   virtual void setLargestBody(std::uint64_t bytes) noexcept = 0;
   // Starts the request and returns at once. A get carries no body, so what is given is not sent.
   virtual void send(std::vector<std::byte> body) = 0;

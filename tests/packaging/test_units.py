@@ -5,6 +5,7 @@
 
 BRENVIK_BUILD names the build folder, BRENVIK_SOURCE the project's.
 """
+import ipaddress
 import json
 import os
 import pathlib
@@ -68,6 +69,20 @@ class Units(unittest.TestCase):
             self.assertIn(path.lstrip("-"), made)
         self.assertIn("/root/Library/Preferences", made)
         self.assertIn("systemd-tmpfiles-setup.service", self.values("After"))
+
+    def test_servers_behind_every_kind_of_unicast_address_are_reachable(self):
+        allowed = [ipaddress.ip_network(each) for line in self.text.splitlines() if line.startswith("IPAddressAllow=")
+                   for each in line.split("=", 1)[1].split()]
+        self.assertIn("IPAddressDeny=any", self.text)
+
+        def is_allowed(address):
+            return any(ipaddress.ip_address(address) in network for network in allowed)
+        # 64:ff9b::/96 and 64:ff9b:1::/48: IPv4 servers as a network without IPv4 sees them (RFC 6052, RFC 8215).
+        for address in ("127.0.0.1", "9.9.9.9", "198.51.100.7", "223.255.255.254", "::1", "2001:db8::1", "fd00::1",
+                        "fe80::1", "64:ff9b::9.9.9.9", "64:ff9b::ffff:ffff", "64:ff9b:1::1", "64:ff9b:1:ffff::9.9.9.9"):
+            self.assertTrue(is_allowed(address), address)
+        for address in ("224.0.0.1", "255.255.255.255", "ff02::1", "::", "64:ff9b:0:0:0:1::", "64:ff9b:2::1", "100::1"):
+            self.assertFalse(is_allowed(address), address)
 
     def test_every_open_point_is_named_with_its_weight(self):
         done = self.analyze("security", "--offline=true", "--json=short", "--no-pager")

@@ -2,10 +2,10 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <array>
 #include <functional>
 #include <memory>
 #include <mutex>
-#include <string>
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
@@ -14,34 +14,51 @@
 
 namespace brenvik {
 
-// Finds the address under which this device is seen from outside, one STUN transaction at a time on a serial
-// queue. Questions asked while a transaction runs share the next one, however many they are.
+// Finds the address under which this device is seen from outside. Each question has a STUN transaction of its
+// own, which begins at once, on a queue of its own. Where there are kMostTransactions already, or no thread
+// for another one, a question shares the transaction that began last.
 class PublicAddressFinder : public std::enable_shared_from_this<PublicAddressFinder> {
  public:
-  // Called on the queue.
+  // A transaction takes eight seconds at most, and a usual one a fraction of one: more come from a caller
+  // that floods, and need not become a flood of datagrams.
+  static constexpr std::size_t kMostTransactions = 4;
+
+  // Called on a queue of the finder's.
   using Deliver = std::function<void(const StunOutcome&)>;
-  // Makes the network of one transaction, whose waiting ends when the descriptor becomes readable.
+  // Makes the network of one transaction, whose waiting ends when the descriptor becomes readable. Any
+  // thread.
   using MakeNetwork = std::function<std::unique_ptr<StunNetwork>(int stopFd)>;
 
-  // On the main queue no transaction runs: it waits. Throws OutOfQueues, here for want of a descriptor.
-  PublicAddressFinder(MakeNetwork makeNetwork, WorkQueue& mainQueue);
+  // The queues outlive it, or its stop(). Throws OutOfQueues, here for want of a descriptor.
+  PublicAddressFinder(MakeNetwork makeNetwork, WorkQueues& queues);
 
-  // Any thread. An error where the queue has no thread to start; that comes from within the call.
-  void find(Deliver deliver, WorkQueue& queue);
-  // Ends the transaction that runs; nothing is delivered from now on. Any thread.
+  // Any thread. An error where there is no thread at all; that comes from within the call.
+  void find(Deliver deliver);
+  // Ends the transactions that run and their threads; nothing is delivered from now on. Not on a queue of the
+  // finder's.
   void stop() noexcept;
 
  private:
-  void runTransaction();
+  struct Transaction {
+    std::vector<Deliver> asked;
+  };
+  struct Worker {
+    std::shared_ptr<WorkQueue> queue;
+    bool isBusy = false;
+  };
 
+  Worker* idleWorker() noexcept;
+  std::vector<Deliver> endOf(const Transaction& transaction, Worker& worker) noexcept;
+  void run(const Transaction& transaction, Worker& worker);
   StunOutcome outcome();
 
   const MakeNetwork makeNetwork_;
-  WorkQueue& mainQueue_;
+  WorkQueues& queues_;
   const UniqueFd stopFd_;
-  std::mutex mutex_;
-  std::vector<Deliver> waiting_;  // under mutex_
-  bool stopped_ = false;          // under mutex_
+  std::mutex mutex_;                                   // guards the rest
+  std::vector<std::unique_ptr<Transaction>> running_;  // in the order they began
+  bool stopped_ = false;
+  std::array<Worker, kMostTransactions> workers_;  // made as they are needed, and kept
 };
 
 }  // namespace brenvik

@@ -26,8 +26,15 @@ std::uint16_t bigEndian16(std::span<const std::byte> bytes) noexcept {
                                     std::to_integer<unsigned>(bytes[1]));
 }
 
+// Of the attributes that nobody may pass over (below 0x8000), those that RFC 8489 knows, or that its
+// forerunners had in answers: 0x0004 and 0x0005 still come from old servers.
+constexpr bool mayBePassedOver(std::uint16_t attribute) noexcept {
+  return attribute >= 0x8000 || (attribute >= 0x0001 && attribute <= 0x000B) || attribute == 0x0014 ||
+         attribute == 0x0015 || (attribute >= 0x001C && attribute <= 0x001E);
+}
+
 // The value of XOR-MAPPED-ADDRESS: a zero, the family, the port, the address; the latter two xor'ed with the
-// cookie and, after it, the transaction id. Empty when it makes no sense.
+// cookie and, after it, the transaction id. Empty when no host can have it.
 std::string addressIn(std::span<const std::byte> value, const StunTransactionId& id) {
   if (value.size() < 4) return {};
   const auto family = std::to_integer<std::uint8_t>(value[1]);
@@ -87,10 +94,12 @@ StunAnswer readStunAnswer(std::span<const std::byte> datagram, const StunTransac
     if (attribute == kXorMappedAddress && !found) {
       found = true;
       address = addressIn(rest.first(length), id);
+    } else if (attribute != kXorMappedAddress && !mayBePassedOver(attribute)) {
+      return {};
     }
     rest = rest.subspan(padded);
   }
-  if (address.empty()) return {};
+  if (address.empty()) return {StunVerdict::noAddress, {}};
   return {StunVerdict::address, std::move(address)};
 }
 

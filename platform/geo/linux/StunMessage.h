@@ -16,8 +16,10 @@ using StunRequest = std::array<std::byte, 20>;
 StunRequest makeStunBindingRequest(const StunTransactionId& id) noexcept;
 
 enum class StunVerdict {
-  ignored,  // no answer to this request, or one that makes no sense
-  refused,  // the server says that it will not answer it
+  ignored,    // no answer to this request, a malformed one, or one that cannot be understood without knowing
+              // more
+  refused,    // the server says that it will not answer it
+  noAddress,  // a success, without an address that a host can have
   address,
 };
 struct StunAnswer {
@@ -25,8 +27,8 @@ struct StunAnswer {
   std::string address;  // IPv4 or IPv6, as inet_ntop(3) writes it
 };
 
-// What a datagram from the server says to the request with this id. An address that no host can have (the
-// unspecified one, a multicast or broadcast one) makes no sense.
+// What a datagram from the server says to the request with this id. No host has an address of another family
+// than IPv4 and IPv6, the unspecified one, one of 0/8, a multicast or a reserved one.
 StunAnswer readStunAnswer(std::span<const std::byte> datagram, const StunTransactionId& id);
 
 }  // namespace brenvik

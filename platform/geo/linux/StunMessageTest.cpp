@@ -106,23 +106,39 @@ TEST(StunMessageTest, AnErrorResponseIsARefusal) {
   EXPECT_EQ(read(answerWith({}, "0111")).verdict, StunVerdict::refused);
 }
 
-TEST(StunMessageTest, ASuccessWithoutAddressIsIgnored) {
-  EXPECT_EQ(read(answerWith({})).verdict, StunVerdict::ignored);
-  EXPECT_EQ(read(answerWith(hex("000100080001a147c0000201"))).verdict, StunVerdict::ignored);
+TEST(StunMessageTest, ASuccessWithoutAddressIsAnAnswerWithoutOne) {
+  EXPECT_EQ(read(answerWith({})).verdict, StunVerdict::noAddress);
+  EXPECT_EQ(read(answerWith(hex("000100080001a147c0000201"))).verdict, StunVerdict::noAddress);
+}
+
+TEST(StunMessageTest, AnUnknownAttributeThatMustBeUnderstoodMakesTheAnswerIgnored) {
+  const std::string address = "002000080001a147e112a643";
+  for (const char* attribute : {"00000000", "000c0000", "00130000", "00160004deadbeef", "001b0000",
+                                "001f0000", "00210000", "00240000", "7fff0000"}) {
+    EXPECT_EQ(read(answerWith(hex((attribute + address).c_str()))).verdict, StunVerdict::ignored)
+        << attribute;
+    EXPECT_EQ(read(answerWith(hex((address + attribute).c_str()))).verdict, StunVerdict::ignored)
+        << attribute;
+    EXPECT_EQ(read(answerWith(hex(attribute))).verdict, StunVerdict::ignored) << attribute;
+  }
+  for (const char* attribute : {"80000000", "8022000474657374", "ffff0000", "0004000800010d96c0000201",
+                                "0005000800010d96c0000201", "001500016e000000"}) {
+    EXPECT_EQ(read(answerWith(hex((attribute + address).c_str()))).address, "192.0.2.1") << attribute;
+  }
 }
 
 TEST(StunMessageTest, TheFirstOfTwoAddressesCounts) {
   EXPECT_EQ(read(answerWith(hex("002000080001a147e112a643 002000080001a147e112a644"))).address, "192.0.2.1");
   EXPECT_EQ(read(answerWith(hex("002000080007a147e112a643 002000080001a147e112a644"))).verdict,
-            StunVerdict::ignored);
+            StunVerdict::noAddress);
 }
 
-TEST(StunMessageTest, AnAddressOfTheWrongLengthOrFamilyIsIgnored) {
+TEST(StunMessageTest, AnAddressOfTheWrongLengthOrFamilyIsNone) {
   for (const char* attribute :
        {"00200000", "002000040001a147", "002000140001a1470113a9faa5d3f179bc25f4b5bed2b9d9",
         "002000080002a147e112a643", "002000080000a147e112a643", "002000080003a147e112a643",
         "002000070001a147e112a643", "00200003000100ff"}) {
-    EXPECT_EQ(read(answerWith(hex(attribute))).verdict, StunVerdict::ignored) << attribute;
+    EXPECT_EQ(read(answerWith(hex(attribute))).verdict, StunVerdict::noAddress) << attribute;
   }
 }
 
@@ -131,16 +147,17 @@ TEST(StunMessageTest, AnAttributeLongerThanTheMessageIsIgnored) {
   EXPECT_EQ(read(answerWith(hex("8022ffff 002000080001a147e112a643"))).verdict, StunVerdict::ignored);
 }
 
-TEST(StunMessageTest, AnAddressThatNoHostCanHaveIsIgnored) {
-  // 0.0.0.0, 224.0.0.1, 255.255.255.255, each xor'ed with the cookie.
+TEST(StunMessageTest, AnAddressThatNoHostCanHaveIsNone) {
+  // 0.0.0.0, 0.1.2.3, 224.0.0.1, 240.0.0.1, 255.255.255.255, each xor'ed with the cookie.
   for (const char* attribute :
-       {"002000080001a1472112a442", "002000080001a147c112a443", "002000080001a147deed5bbd"}) {
-    EXPECT_EQ(read(answerWith(hex(attribute))).verdict, StunVerdict::ignored) << attribute;
+       {"002000080001a1472112a442", "002000080001a1472113a641", "002000080001a147c112a443",
+        "002000080001a147d112a443", "002000080001a147deed5bbd"}) {
+    EXPECT_EQ(read(answerWith(hex(attribute))).verdict, StunVerdict::noAddress) << attribute;
   }
   // :: and ff02::1
   for (const char* attribute : {"002000140002a1472112a442000102030405060708090a0b",
                                 "002000140002a147de10a442000102030405060708090a0a"}) {
-    EXPECT_EQ(read(answerWith(hex(attribute))).verdict, StunVerdict::ignored) << attribute;
+    EXPECT_EQ(read(answerWith(hex(attribute))).verdict, StunVerdict::noAddress) << attribute;
   }
 }
 

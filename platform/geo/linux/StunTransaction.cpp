@@ -27,8 +27,7 @@ class Transaction {
       bool due = false;
       for (; sendings < kStunSchedule.size() && kStunSchedule[sendings] <= now; ++sendings) due = true;
       if (due) sendTo(std::exchange(first_, false) ? 1 : peers_.size());
-      if (allFailed())
-        return failure(refused_ ? "the STUN server refuses" : "the STUN server cannot be reached");
+      if (allFailed()) return failure(problem_);
       const std::chrono::nanoseconds until =
           sendings < kStunSchedule.size() ? kStunSchedule[sendings] : kStunPatience;
       auto event = network_.wait(until);
@@ -74,7 +73,11 @@ class Transaction {
       case StunVerdict::address:
         return StunOutcome{std::move(answer.address), {}};
       case StunVerdict::refused:
-        refused_ = true;
+        problem_ = "the STUN server refuses";
+        fail(event.peer);
+        break;
+      case StunVerdict::noAddress:
+        problem_ = "the STUN server's answer has no address";
         fail(event.peer);
         break;
       case StunVerdict::ignored:
@@ -92,7 +95,7 @@ class Transaction {
   const StunRequest request_;
   std::vector<Peer> peers_;
   bool first_ = true;
-  bool refused_ = false;
+  const char* problem_ = "the STUN server cannot be reached";  // once all peers have failed
   bool complained_ = false;
 };
 

@@ -157,6 +157,26 @@ TEST_F(StunTransactionTest, AnErrorResponseEndsIt) {
   EXPECT_EQ(network.clock.now(), 5ms);
 }
 
+TEST_F(StunTransactionTest, ASuccessWithoutAnAddressEndsItAtOnce) {
+  auto answer = answerFor(network.request);
+  answer.resize(20);
+  answer[3] = std::byte{0};
+  network.arrivesAt(5ms, {Event::Kind::datagram, 0, answer});
+  EXPECT_EQ(problemOf(run()), "the STUN server's answer has no address");
+  EXPECT_EQ(network.clock.now(), 5ms);
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(StunTransactionTest, AnAnswerThatMustNotBeUnderstoodIsDiscardedAndTheNextOneCounts) {
+  auto answer = answerFor(network.request);
+  answer[3] = std::byte{16};
+  for (const int byte : {0x7f, 0xff, 0x00, 0x00}) answer.push_back(static_cast<std::byte>(byte));
+  network.arrivesAt(5ms, {Event::Kind::datagram, 0, answer});
+  network.answersAt(10ms);
+  EXPECT_EQ(run().address, "192.0.2.1");
+  EXPECT_EQ(network.clock.now(), 10ms);
+}
+
 TEST_F(StunTransactionTest, WrongAnswersAreIgnoredAndSaidOnce) {
   auto wrong = answerFor(network.request);
   wrong[19] ^= std::byte{1};

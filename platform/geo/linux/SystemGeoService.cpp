@@ -62,13 +62,13 @@ class SystemGeoService::IpTicket final : public GeoIpTicket {
       answerOn(handlerQueue, handler, std::move(result), found.error);
     };
     if (!ofThisDevice_) return deliver({{}, GeoError{"only this device's own address can be looked up"}});
-    const std::lock_guard lock(service_.mutex_);
+    std::shared_ptr<PublicAddressFinder> finder;
     try {
-      service_.makeAddressFinder();
+      finder = service_.addressFinder();
     } catch (const OutOfQueues&) {
       return deliver({{}, GeoError{kNoQueue}});
     }
-    service_.addressFinder_->find(std::move(deliver), *service_.addressQueue_);
+    finder->find(std::move(deliver));
   }
 
  private:
@@ -88,14 +88,14 @@ SystemGeoService::SystemGeoService(WorkQueues& queues, WebClient& webClient, Set
 SystemGeoService::~SystemGeoService() {
   geocoder_->close();
   std::shared_ptr<WorkQueue> places;
-  std::shared_ptr<WorkQueue> addresses;
+  std::shared_ptr<PublicAddressFinder> finder;
   {
     const std::lock_guard lock(mutex_);
-    if (addressFinder_ != nullptr) addressFinder_->stop();
     places.swap(placesQueue_);
-    addresses.swap(addressQueue_);
+    finder.swap(addressFinder_);
   }
-  // The queues join their threads here, without the lock.
+  // Threads are joined here and by the queue's end, without the lock.
+  if (finder != nullptr) finder->stop();
 }
 
 std::shared_ptr<WorkQueue> SystemGeoService::placesQueue() {
@@ -106,13 +106,14 @@ std::shared_ptr<WorkQueue> SystemGeoService::placesQueue() {
   return placesQueue_;
 }
 
-void SystemGeoService::makeAddressFinder() {
-  if (addressQueue_ != nullptr) return;
-  auto finder = std::make_shared<PublicAddressFinder>(
-      [server = stunServer_](int stopFd) { return std::make_unique<UdpStunNetwork>(server, stopFd); },
-      queues_.main());
-  addressQueue_ = queues_.makeSerial("geo service: address", QualityOfService::standard);
-  addressFinder_ = std::move(finder);
+std::shared_ptr<PublicAddressFinder> SystemGeoService::addressFinder() {
+  const std::lock_guard lock(mutex_);
+  if (addressFinder_ == nullptr) {
+    addressFinder_ = std::make_shared<PublicAddressFinder>(
+        [server = stunServer_](int stopFd) { return std::make_unique<UdpStunNetwork>(server, stopFd); },
+        queues_);
+  }
+  return addressFinder_;
 }
 
 std::unique_ptr<ReverseGeocodeTicket> SystemGeoService::makeReverseGeocodeTicket(Coordinate coordinate,

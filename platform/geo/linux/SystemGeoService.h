@@ -19,8 +19,8 @@ namespace brenvik {
 class PublicAddressFinder;
 
 // The geo service on Linux: addresses from a server or the offline gazetteer, the public address by STUN, the
-// country configuration from its file. Two queues of its own do the work, each made with the first question
-// for it.
+// country configuration from its file. Queues of its own do the work, each made with the first question that
+// needs it: one for places, one for each transaction that runs at a time.
 class SystemGeoService final : public GeoService {
  public:
   struct Settings {
@@ -49,8 +49,8 @@ class SystemGeoService final : public GeoService {
   class IpTicket;
   // Throws OutOfQueues.
   std::shared_ptr<WorkQueue> placesQueue();
-  // Under mutex_. Throws OutOfQueues.
-  void makeAddressFinder();
+  // Throws OutOfQueues.
+  std::shared_ptr<PublicAddressFinder> addressFinder();
 
   WorkQueues& queues_;
   const std::shared_ptr<CountryConfiguration> country_;
@@ -58,8 +58,7 @@ class SystemGeoService final : public GeoService {
   const std::string stunServer_;
   std::mutex mutex_;
   std::shared_ptr<WorkQueue> placesQueue_;              // under mutex_
-  std::shared_ptr<WorkQueue> addressQueue_;             // under mutex_
-  std::shared_ptr<PublicAddressFinder> addressFinder_;  // under mutex_, made with its queue
+  std::shared_ptr<PublicAddressFinder> addressFinder_;  // under mutex_
 };
 
 }  // namespace brenvik

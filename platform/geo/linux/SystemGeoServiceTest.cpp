@@ -6,8 +6,12 @@
 #include <netinet/in.h>
 #include <sys/socket.h>
 
+#include <atomic>
+#include <condition_variable>
 #include <future>
 #include <limits>
+#include <mutex>
+#include <set>
 
 #include "platform/geo/linux/PublicAddressFinder.h"
 #include "platform/log/fakes/RecordingLog.h"
@@ -119,6 +123,32 @@ TEST_F(SystemGeoServiceTest, APublicAddressThatCannotBeHadIsAnError) {
   EXPECT_EQ(answered.get_future().get(), "the STUN server cannot be reached");
 }
 
+TEST_F(SystemGeoServiceTest, EachTicketForThePublicAddressGoesOutAtOnce) {
+  SilentServer silent;
+  const timeval patience{5, 0};  // a transaction that is not answered takes longer
+  ASSERT_EQ(::setsockopt(silent.socket.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience), 0);
+  settings.stunServer = silent.name;
+  SystemGeoService service(queues, web, settings);
+  const auto ask = [&] {
+    service.makeGeoIpTicket(std::nullopt)
+        ->submit([](const auto&, const auto&) {}, nullptr, nullptr, handlers);
+  };
+  ask();
+  ask();
+  std::set<std::vector<char>> requests;
+  int sendingsOfTheFirst = 0;
+  while (requests.size() < 2) {
+    std::vector<char> request(100);
+    const auto size = ::recv(silent.socket.get(), request.data(), request.size(), 0);
+    ASSERT_GT(size, 0) << "the second waits for the first";
+    request.resize(static_cast<std::size_t>(size));
+    requests.insert(request);  // one that is sent again is the same
+    if (requests.size() == 1 && ++sendingsOfTheFirst > 5) break;
+  }
+  EXPECT_EQ(requests.size(), 2U);
+  EXPECT_LE(sendingsOfTheFirst, 4) << "the fifth is the last";
+}
+
 TEST_F(SystemGeoServiceTest, AnotherAddressThanOnesOwnIsNotLookedUp) {
   SystemGeoService service(queues, web, settings);
   std::promise<std::string> answered;
@@ -204,102 +234,180 @@ TEST_F(SystemGeoServiceTest, WithoutAThreadToWorkOnQuestionsEndInAnErrorAndLater
   EXPECT_EQ(problems(), "none; the STUN server cannot be reached");
 }
 
-TEST(PublicAddressFinderTest, AQueueThatCannotStartLeavesNobodyWaiting) {
-  class Reluctant final : public WorkQueue {
+// ---- transactions -----------------------------------------------------------------------------------------
+
+// A network whose server's name has no address. That is found out once `go` says so.
+class NobodyOnceTold final : public StunNetwork {
+ public:
+  explicit NobodyOnceTold(std::shared_future<void> go) : go_(std::move(go)) {}
+  std::chrono::nanoseconds elapsed() override { return 0s; }
+  std::size_t findPeers(std::chrono::nanoseconds) override {
+    go_.wait();
+    return 0;
+  }
+  bool send(std::size_t, std::span<const std::byte>) override { return false; }
+  Event wait(std::chrono::nanoseconds) override { return {}; }
+
+ private:
+  const std::shared_future<void> go_;
+};
+
+class PublicAddressFinderTest : public testing::Test {
+ protected:
+  // Counts the transactions and, where `untilAllRun` is set, holds them until so many have begun.
+  std::unique_ptr<StunNetwork> makeNetwork() {
+    if (++transactions == untilAllRun) go.set_value();
+    return std::make_unique<NobodyOnceTold>(gone);
+  }
+  void ask(PublicAddressFinder& finder) {
+    finder.find([this](const StunOutcome& outcome) {
+      const std::lock_guard lock(mutex);
+      problems.push_back(outcome.error.value().description);
+      answered.notify_all();
+    });
+  }
+  // False when they have not come after a while.
+  bool haveCome(std::size_t answers) {
+    std::unique_lock lock(mutex);
+    return answered.wait_for(lock, 10s, [&] { return problems.size() >= answers; });
+  }
+  std::shared_ptr<PublicAddressFinder> make(WorkQueues& workQueues) {
+    return std::make_shared<PublicAddressFinder>([this](int) { return makeNetwork(); }, workQueues);
+  }
+
+  std::promise<void> go;
+  std::shared_future<void> gone = go.get_future().share();
+  std::atomic<int> transactions = 0;
+  int untilAllRun = 0;
+  std::mutex mutex;
+  std::condition_variable answered;
+  std::vector<std::string> problems;
+  std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
+  SystemQueues queues{*loop};
+};
+
+TEST_F(PublicAddressFinderTest, AQuestionDoesNotWaitForTheTransactionOfAnother) {
+  untilAllRun = 3;
+  const auto finder = make(queues);
+  for (int i = 0; i < untilAllRun; ++i) ask(*finder);
+  const bool allRun = gone.wait_for(10s) == std::future_status::ready;
+  EXPECT_TRUE(allRun) << "each of them ends when all have begun";
+  if (!allRun) go.set_value();
+  EXPECT_TRUE(haveCome(3));
+  EXPECT_EQ(transactions, 3);
+  finder->stop();
+}
+
+TEST_F(PublicAddressFinderTest, OfAFloodOfQuestionsTheLaterOnesShareATransaction) {
+  const auto finder = make(queues);
+  for (int i = 0; i < 100; ++i) ask(*finder);
+  go.set_value();
+  EXPECT_TRUE(haveCome(100));
+  EXPECT_EQ(transactions, static_cast<int>(PublicAddressFinder::kMostTransactions));
+  ask(*finder);
+  EXPECT_TRUE(haveCome(101));
+  EXPECT_EQ(transactions, static_cast<int>(PublicAddressFinder::kMostTransactions) + 1) << "nothing is kept";
+  finder->stop();
+}
+
+TEST_F(PublicAddressFinderTest, AFinderThatIsStoppedDeliversNothing) {
+  const auto finder = make(queues);
+  ask(*finder);
+  go.set_value();
+  finder->stop();
+  const auto delivered = problems.size();
+  EXPECT_LE(delivered, 1U) << "it may have been faster";
+  ask(*finder);
+  EXPECT_EQ(problems.size(), delivered);
+}
+
+// Queues that can no longer be had, or whose thread no longer starts, when the test says so.
+class ScarceQueues final : public WorkQueues {
+ public:
+  explicit ScarceQueues(ManualClock& clock) : clock_(clock) {}
+  WorkQueue& main() noexcept override { return main_; }
+  WorkQueue& global() override { return main_; }
+  std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
+    if (none) throw OutOfQueues();
+    EXPECT_EQ(qualityOfService, QualityOfService::standard);
+    made.push_back(std::make_shared<Queue>(*this, clock_, std::move(label)));
+    return made.back();
+  }
+  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t, std::uint32_t, WorkQueue::Task,
+                                                           WorkQueue::Task) override {
+    return nullptr;
+  }
+
+  class Queue final : public WorkQueue {
    public:
-    const std::string& label() const noexcept override { return label_; }
+    Queue(ScarceQueues& owner, ManualClock& clock, std::string label)
+        : owner_(owner), real(clock, std::move(label)) {}
+    const std::string& label() const noexcept override { return real.label(); }
     void post(Task task) override {
-      if (refuses) throw OutOfQueues();
-      task();
+      if (owner_.noThread) throw OutOfQueues();
+      real.post(std::move(task));
     }
-    void postAfter(std::chrono::nanoseconds, Task) override {}
+    void postAfter(std::chrono::nanoseconds delay, Task task) override {
+      real.postAfter(delay, std::move(task));
+    }
     std::unique_ptr<Timer> makeTimer(std::chrono::nanoseconds, std::chrono::nanoseconds,
                                      std::chrono::nanoseconds, Task) override {
       return nullptr;
     }
-    bool isCurrent() const noexcept override { return false; }
+    bool isCurrent() const noexcept override { return real.isCurrent(); }
     std::unique_ptr<DescriptorSource> watchDescriptor(int, std::uint32_t,
                                                       RunLoop::DescriptorHandler) override {
       return nullptr;
     }
-    bool refuses = true;
 
    private:
-    const std::string label_ = "reluctant";
-  };
-  class Nobody final : public StunNetwork {
+    ScarceQueues& owner_;
+
    public:
-    std::chrono::nanoseconds elapsed() override { return 0s; }
-    std::size_t findPeers(std::chrono::nanoseconds) override { return 0; }
-    bool send(std::size_t, std::span<const std::byte>) override { return false; }
-    Event wait(std::chrono::nanoseconds) override { return {}; }
+    ManualWorkQueue real;
   };
+
+  bool none = false;
+  bool noThread = false;
+  std::vector<std::shared_ptr<Queue>> made;
+
+ private:
+  ManualClock& clock_;
+  ManualWorkQueue main_{clock_, "main"};
+};
+
+TEST_F(PublicAddressFinderTest, WithoutAThreadNobodyIsLeftWaitingAndALaterQuestionIsAnswered) {
   ManualClock clock;
-  ManualWorkQueue mainQueue(clock);
-  Reluctant queue;
-  const auto finder =
-      std::make_shared<PublicAddressFinder>([](int) { return std::make_unique<Nobody>(); }, mainQueue);
-  std::vector<std::string> problems;
-  const auto ask = [&] {
-    finder->find([&](const StunOutcome& outcome) { problems.push_back(outcome.error.value().description); },
-                 queue);
-  };
-  ask();
-  queue.refuses = false;
-  ask();
-  EXPECT_EQ(problems, (std::vector<std::string>{"no thread to wait on",
-                                                "the name of the STUN server cannot be resolved"}));
+  ScarceQueues scarce(clock);
+  go.set_value();
+  const auto finder = make(scarce);
+  scarce.none = true;
+  ask(*finder);
+  scarce.none = false;
+  scarce.noThread = true;
+  ask(*finder);
+  EXPECT_EQ(problems, (std::vector<std::string>(2, "the geo service has no thread to work on")));
+  scarce.noThread = false;
+  ask(*finder);
+  ASSERT_EQ(scarce.made.size(), 1U);
+  scarce.made[0]->real.runReady();
+  ASSERT_EQ(problems.size(), 3U);
+  EXPECT_EQ(problems[2], "the name of the STUN server cannot be resolved");
 }
 
-TEST(PublicAddressFinderTest, QuestionsDuringATransactionShareTheNext) {
-  // A network that finds nobody, and counts how often it was made.
-  class Nobody final : public StunNetwork {
-   public:
-    std::chrono::nanoseconds elapsed() override { return 0s; }
-    std::size_t findPeers(std::chrono::nanoseconds) override {
-      if (during) during();
-      return 0;
-    }
-    bool send(std::size_t, std::span<const std::byte>) override { return false; }
-    Event wait(std::chrono::nanoseconds) override { return {}; }
-    std::function<void()> during;
-  };
+TEST_F(PublicAddressFinderTest, WhereThereIsNoThreadForAnotherTransactionTheOneThatRunsIsShared) {
   ManualClock clock;
-  ManualWorkQueue queue(clock);
-  ManualWorkQueue mainQueue(clock);
-  int networks = 0;
-  int answers = 0;
-  std::shared_ptr<PublicAddressFinder> finder;
-  finder = std::make_shared<PublicAddressFinder>(
-      [&](int) {
-        auto network = std::make_unique<Nobody>();
-        if (++networks == 1) {
-          network->during = [&] {
-            for (int i = 0; i < 100; ++i) finder->find([&](const StunOutcome&) { ++answers; }, queue);
-          };
-        }
-        return network;
-      },
-      mainQueue);
-  finder->find([&](const StunOutcome& outcome) { answers += outcome.error ? 1 : 0; }, queue);
-  queue.runReady();
-  EXPECT_EQ(networks, 2);
-  EXPECT_EQ(answers, 101);
-}
-
-TEST(PublicAddressFinderTest, NoTransactionRunsOnTheMainQueue) {
-  ManualClock clock;
-  ManualWorkQueue mainQueue(clock);
-  const auto finder = std::make_shared<PublicAddressFinder>(
-      [](int) -> std::unique_ptr<StunNetwork> {
-        ADD_FAILURE() << "would block the main loop";
-        return nullptr;
-      },
-      mainQueue);
-  std::string problem;
-  finder->find([&](const StunOutcome& outcome) { problem = outcome.error.value().description; }, mainQueue);
-  mainQueue.runReady();
-  EXPECT_EQ(problem, "no thread to wait on");
+  ScarceQueues scarce(clock);
+  go.set_value();
+  const auto finder = make(scarce);
+  ask(*finder);
+  scarce.none = true;
+  ask(*finder);
+  ASSERT_EQ(scarce.made.size(), 1U);
+  EXPECT_EQ(scarce.made[0]->label(), "geo service: address");
+  scarce.made[0]->real.runReady();
+  EXPECT_EQ(problems, (std::vector<std::string>(2, "the name of the STUN server cannot be resolved")));
+  EXPECT_EQ(transactions, 1);
 }
 
 }  // namespace

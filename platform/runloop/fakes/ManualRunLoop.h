@@ -61,6 +61,11 @@ class ManualWorkQueue final : public WorkQueue {
   const std::string& label() const noexcept override { return label_; }
   QualityOfService qualityOfService() const noexcept { return qualityOfService_; }
 
+  // What becomes of timers from now on, and the leeway each was asked for with.
+  enum class Timers { work, cannotBeMade, cannotBeArmed };
+  Timers timers = Timers::work;
+  std::vector<std::chrono::nanoseconds> leeways;
+
   void post(Task task) override { ready_.push_back(std::move(task)); }
   void postAfter(std::chrono::nanoseconds delay, Task task) override {
     clock_.schedule(delay, [alive = std::weak_ptr<void>(alive_), this, task = std::move(task)]() mutable {
@@ -119,6 +124,7 @@ class ManualWorkQueue::ManualTimer final : public WorkQueue::Timer {
         handler_(std::make_shared<Task>(std::move(handler))) {}
   ~ManualTimer() override { cancel(); }
   bool activate() override {
+    if (queue_.timers == Timers::cannotBeArmed) return false;
     if (!active_) {
       active_ = true;
       arm(first_);
@@ -154,7 +160,10 @@ class ManualWorkQueue::ManualTimer final : public WorkQueue::Timer {
 
 inline std::unique_ptr<WorkQueue::Timer> ManualWorkQueue::makeTimer(std::chrono::nanoseconds first,
                                                                     std::chrono::nanoseconds interval,
-                                                                    std::chrono::nanoseconds, Task handler) {
+                                                                    std::chrono::nanoseconds leeway,
+                                                                    Task handler) {
+  leeways.push_back(leeway);
+  if (timers == Timers::cannotBeMade) return nullptr;
   return std::make_unique<ManualTimer>(*this, first, interval, std::move(handler));
 }
 

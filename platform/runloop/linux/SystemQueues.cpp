@@ -11,7 +11,9 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <exception>
 #include <functional>
+#include <future>
 #include <mutex>
 #include <system_error>
 #include <thread>
@@ -29,8 +31,12 @@ constexpr int kIoPriorityWhoProcess = 1;
 constexpr int kIoPriorityUtility = (2 << 13) | 7;
 constexpr int kNiceUtility = 10;
 
+// A thread begins with the priority of the one that makes it, and may not raise its own without a capability.
+thread_local bool isLowered = false;
+
 void applyQualityOfService(QualityOfService qualityOfService) noexcept {
   if (qualityOfService != QualityOfService::utility) return;
+  isLowered = true;
   const auto self = static_cast<id_t>(::syscall(SYS_gettid));
   // Both are courtesies: without them the work is done all the same.
   (void)::setpriority(PRIO_PROCESS, self, kNiceUtility);
@@ -103,9 +109,14 @@ class SystemQueue : public WorkQueue {
 // A queue with a thread of its own, started by its first task.
 class ThreadQueue final : public SystemQueue {
  public:
-  ThreadQueue(std::shared_ptr<EventLoop> loop, std::string label, QualityOfService qualityOfService)
+  // A queue of standard quality, whose thread can make others of that quality; null where there is none.
+  using StandardQueue = std::function<std::shared_ptr<WorkQueue>()>;
+
+  ThreadQueue(std::shared_ptr<EventLoop> loop, std::string label, QualityOfService qualityOfService,
+              StandardQueue standardQueue)
       : SystemQueue(std::move(loop), std::move(label)),
         qualityOfService_(qualityOfService),
+        standardQueue_(std::move(standardQueue)),
         quit_(std::make_shared<std::atomic<bool>>(false)) {}
 
   ~ThreadQueue() override {
@@ -123,15 +134,9 @@ class ThreadQueue final : public SystemQueue {
   void start() override {
     std::call_once(started_, [this] {
       try {
-        // The kernel keeps 15 characters of a name. A thread that names itself needs no descriptor for that.
-        thread_ = std::thread(
-            [loop = loop_, quit = quit_, qualityOfService = qualityOfService_, name = label().substr(0, 15)] {
-              (void)::pthread_setname_np(::pthread_self(), name.c_str());
-              applyQualityOfService(qualityOfService);
-              while (!quit->load()) {
-                if (loop->runOnce(kNoTimeOut) < 0) break;
-              }
-            });
+        if (qualityOfService_ == QualityOfService::utility && !isLowered) prepareForLoweredMakers();
+        thread_ = qualityOfService_ == QualityOfService::standard && isLowered ? makeStandardThread()
+                                                                               : makeThread();
       } catch (const std::system_error&) {
         throw OutOfQueues();
       }
@@ -139,7 +144,46 @@ class ThreadQueue final : public SystemQueue {
   }
 
  private:
+  std::thread makeThread() {
+    // The kernel keeps 15 characters of a name. A thread that names itself needs no descriptor for that.
+    return std::thread(
+        [loop = loop_, quit = quit_, qualityOfService = qualityOfService_, name = label().substr(0, 15)] {
+          (void)::pthread_setname_np(::pthread_self(), name.c_str());
+          applyQualityOfService(qualityOfService);
+          while (!quit->load()) {
+            if (loop->runOnce(kNoTimeOut) < 0) break;
+          }
+        });
+  }
+
+  // Before there is a first thread of low priority: has a thread of the standard one run, which makes those
+  // that a low one asks for.
+  void prepareForLoweredMakers() const noexcept try {
+    if (const auto maker = standardQueue_()) maker->post([] {});
+  } catch (const std::bad_alloc&) {
+    // The work of those threads is done all the same, later.
+  }
+
+  std::thread makeStandardThread() {
+    const auto made = std::make_shared<std::promise<std::thread>>();
+    try {
+      const auto maker = standardQueue_();
+      if (maker == nullptr || maker.get() == this) return makeThread();
+      maker->post([this, made] {
+        try {
+          made->set_value(makeThread());
+        } catch (...) {
+          made->set_exception(std::current_exception());
+        }
+      });
+    } catch (const std::bad_alloc&) {
+      return makeThread();  // a slow one is better than none
+    }
+    return made->get_future().get();
+  }
+
   const QualityOfService qualityOfService_;
+  const StandardQueue standardQueue_;
   const std::shared_ptr<std::atomic<bool>> quit_;
   std::once_flag started_;
   std::thread thread_;
@@ -170,7 +214,7 @@ class RaisedLimit {
 }  // namespace
 
 // Makes the serial queues and, when it is first wanted, the global one.
-class SystemQueues::Maker {
+class SystemQueues::Maker : public std::enable_shared_from_this<Maker> {
  public:
   std::shared_ptr<WorkQueue> make(std::string label, QualityOfService qualityOfService) {
     auto loop = EventLoop::make(EventLoop::For::anotherThread);
@@ -181,15 +225,21 @@ class SystemQueues::Maker {
       loop = EventLoop::make(EventLoop::For::anotherThread);
     }
     if (loop == nullptr) throw OutOfQueues();
-    return std::make_shared<ThreadQueue>(std::move(loop), std::move(label), qualityOfService);
+    const auto standardQueue = [weak = weak_from_this()]() -> std::shared_ptr<WorkQueue> {
+      const auto self = weak.lock();
+      return self != nullptr ? self->sharedGlobal() : nullptr;
+    };
+    return std::make_shared<ThreadQueue>(std::move(loop), std::move(label), qualityOfService, standardQueue);
   }
-  WorkQueue& global() {
-    const std::lock_guard lock(mutex_);
-    if (global_ == nullptr) global_ = make("global", QualityOfService::standard);
-    return *global_;
-  }
+  WorkQueue& global() { return *sharedGlobal(); }
 
  private:
+  std::shared_ptr<WorkQueue> sharedGlobal() {
+    const std::lock_guard lock(mutex_);
+    if (global_ == nullptr) global_ = make("global", QualityOfService::standard);
+    return global_;
+  }
+
   std::mutex mutex_;
   std::shared_ptr<WorkQueue> global_;
 };

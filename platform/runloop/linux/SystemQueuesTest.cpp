@@ -283,6 +283,40 @@ TEST_F(SystemQueuesTest, UtilityQueueIsNicerThanTheRest) {
   EXPECT_EQ(ioPriority, (2 << 13) | 7);
 }
 
+// Runs a task on the queue and one that is delayed; whether both ran on a thread that is not this one.
+bool works(WorkQueue& queue) {
+  std::promise<bool> done;
+  queue.post([&] {
+    queue.postAfter(1ms, [&, on = std::this_thread::get_id()] {
+      done.set_value(on == std::this_thread::get_id() && queue.isCurrent());
+    });
+  });
+  return done.get_future().get() && !queue.isCurrent();
+}
+
+TEST_F(SystemQueuesTest, AStandardQueueIsStandardWhicheverThreadStartsIt) {
+  const auto priorities = [] {
+    const auto self = static_cast<id_t>(::syscall(SYS_gettid));
+    return std::make_pair(::getpriority(PRIO_PROCESS, self), ::syscall(SYS_ioprio_get, 1, 0));
+  };
+  const auto usual = priorities();
+  SystemQueues queues(*loop);
+  const auto utility = queues.makeSerial("utility", QualityOfService::utility);
+  std::promise<std::shared_ptr<WorkQueue>> made;
+  std::promise<std::pair<int, long>> done;
+  std::promise<std::pair<int, long>> ofGlobal;
+  utility->post([&] {
+    const auto standard = queues.makeSerial("standard", QualityOfService::standard);
+    standard->post([&] { done.set_value(priorities()); });
+    queues.global().post([&] { ofGlobal.set_value(priorities()); });
+    made.set_value(standard);
+  });
+  const auto standard = made.get_future().get();
+  EXPECT_EQ(done.get_future().get(), usual);
+  EXPECT_EQ(ofGlobal.get_future().get(), usual);
+  EXPECT_TRUE(works(*standard));
+}
+
 TEST_F(SystemQueuesTest, DestroyingAQueueLetsTheRunningTaskFinishAndDropsWhatIsDelayed) {
   SystemQueues queues(*loop);
   auto queue = queues.makeSerial("short", QualityOfService::standard);
@@ -368,17 +402,6 @@ class NoDescriptors {
   rlimit before_{};
   std::vector<UniqueFd> taken_;
 };
-
-// Runs a task on the queue and one that is delayed; whether both ran on a thread that is not this one.
-bool works(WorkQueue& queue) {
-  std::promise<bool> done;
-  queue.post([&] {
-    queue.postAfter(1ms, [&, on = std::this_thread::get_id()] {
-      done.set_value(on == std::this_thread::get_id() && queue.isCurrent());
-    });
-  });
-  return done.get_future().get() && !queue.isCurrent();
-}
 
 constexpr std::size_t kReservedQueues =
     SystemQueues::kReservedDescriptors / EventLoop::kDescriptorsForAnotherThread;

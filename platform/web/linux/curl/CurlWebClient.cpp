@@ -8,6 +8,8 @@
 #include <sys/socket.h>
 
 #include <algorithm>
+#include <cstdlib>
+#include <cstring>
 #include <map>
 #include <mutex>
 #include <new>
@@ -52,13 +54,36 @@ using Easy = std::unique_ptr<CURL, EasyCleanup>;
 using Multi = std::unique_ptr<CURLM, MultiCleanup>;
 using List = std::unique_ptr<curl_slist, ListCleanup>;
 
+// The heap as libcurl uses it. It also says "out of memory" when a header line is longer than it takes;
+// whether an allocation has failed on this thread tells the two apart.
+struct NotingMemory {
+  static thread_local bool failed;
+  static void* noted(void* memory, std::size_t size) noexcept {
+    if (memory == nullptr && size > 0) failed = true;
+    return memory;
+  }
+  static void* allocate(std::size_t size) noexcept { return noted(std::malloc(size), size); }
+  static void* reallocate(void* old, std::size_t size) noexcept {
+    return noted(std::realloc(old, size), size);
+  }
+  static void* allocateZeroed(std::size_t count, std::size_t size) noexcept {
+    return noted(std::calloc(count, size), std::min(count, size));
+  }
+  static char* copyText(const char* text) noexcept { return static_cast<char*>(noted(::strdup(text), 1)); }
+};
+thread_local bool NotingMemory::failed = false;
+
 // Once a process and never undone: other parts may use the library too. A start that failed, for want of
 // memory say, is tried again.
 bool startLibrary() noexcept {
   static std::mutex mutex;
   static bool started = false;
   const std::lock_guard lock(mutex);
-  if (!started) started = curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
+  if (!started) {
+    started = curl_global_init_mem(CURL_GLOBAL_DEFAULT, &NotingMemory::allocate, &std::free,
+                                   &NotingMemory::reallocate, &NotingMemory::copyText,
+                                   &NotingMemory::allocateZeroed) == CURLE_OK;
+  }
   return started;
 }
 
@@ -90,7 +115,7 @@ struct CurlWebClient::Transfer {
 
   const CurlSettings* settings = nullptr;
   bool cellularAllowed = true;
-  Clock::time_point deadline = Clock::time_point::max();
+  Clock::time_point deadline;
   int redirects = 0;
   std::shared_ptr<WebResponse> response = std::make_shared<WebResponse>();
   // Of the present attempt:
@@ -122,6 +147,14 @@ struct CurlWebClient::Transfer {
     callbackQueue.reset();
   }
 
+  // How large the body of the response that is coming in may be.
+  std::uint64_t limitNow() const noexcept {
+    long status = 0;
+    (void)curl_easy_getinfo(easy.get(), CURLINFO_RESPONSE_CODE, &status);
+    return isRedirect(status) ? std::min(largestBody, kLargestRedirectBody) : largestBody;
+  }
+
+  static int onProgress(void* self, curl_off_t, curl_off_t received, curl_off_t, curl_off_t) noexcept;
   static std::size_t onHeader(char* data, std::size_t, std::size_t size, void* self) noexcept;
   static std::size_t onBody(char* data, std::size_t, std::size_t size, void* self) noexcept;
   static curl_socket_t onOpenSocket(void* self, curlsocktype purpose, curl_sockaddr* address) noexcept;
@@ -142,10 +175,21 @@ std::size_t CurlWebClient::Transfer::onHeader(char* data, std::size_t, std::size
   }
 }
 
+// The bytes of the body as they travel: an encoded body may have any number of them and decode to nothing, so
+// that onBody() never hears of it.
+int CurlWebClient::Transfer::onProgress(void* self, curl_off_t, curl_off_t received, curl_off_t,
+                                        curl_off_t) noexcept {
+  auto& transfer = *static_cast<Transfer*>(self);
+  if (received <= 0 || static_cast<std::uint64_t>(received) <= transfer.limitNow()) return 0;
+  transfer.ownVerdict = WebErrorKind::bodyTooLarge;
+  return 1;
+}
+
 std::size_t CurlWebClient::Transfer::onBody(char* data, std::size_t, std::size_t size, void* self) noexcept {
   auto& transfer = *static_cast<Transfer*>(self);
   auto& body = transfer.response->body;
-  if (size > transfer.largestBody - body.size()) {
+  const std::uint64_t limit = transfer.limitNow();
+  if (size > limit - std::min<std::uint64_t>(limit, body.size())) {
     transfer.ownVerdict = WebErrorKind::bodyTooLarge;
     return 0;
   }
@@ -156,7 +200,7 @@ std::size_t CurlWebClient::Transfer::onBody(char* data, std::size_t, std::size_t
       if (curl_easy_getinfo(transfer.easy.get(), CURLINFO_CONTENT_LENGTH_DOWNLOAD_T, &announced) ==
               CURLE_OK &&
           announced > 0) {
-        body.reserve(std::min<std::uint64_t>(static_cast<std::uint64_t>(announced), transfer.largestBody));
+        body.reserve(std::min<std::uint64_t>(static_cast<std::uint64_t>(announced), limit));
       }
     }
     body.append(std::as_bytes(std::span(data, size)));
@@ -196,7 +240,10 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
   void submit(std::shared_ptr<Transfer> transfer) {
     transfer->settings = &settings_;
     transfer->cellularAllowed = transfer->session == nullptr || transfer->session->cellularAllowed;
-    if (transfer->timeLimit > milliseconds::zero()) transfer->deadline = Clock::now() + transfer->timeLimit;
+    milliseconds limit =
+        settings_.wholeLimit + milliseconds(transfer->largestBody * 1000 / settings_.slowestBytesPerSecond);
+    if (transfer->timeLimit > milliseconds::zero()) limit = std::min(limit, transfer->timeLimit);
+    transfer->deadline = Clock::now() + limit;
     auto kind = WebErrorKind::cancelled;
     {
       const std::lock_guard lock(mutex_);
@@ -274,11 +321,8 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
         !mayLookUpName(url->host, settings_.cellularFiles)) {
       return transfer->finish(WebErrorKind::cellularNotAllowed);
     }
-    milliseconds left{0};
-    if (transfer->deadline != Clock::time_point::max()) {
-      left = std::chrono::ceil<milliseconds>(transfer->deadline - Clock::now());
-      if (left <= milliseconds::zero()) return transfer->finish(WebErrorKind::timedOut);
-    }
+    const auto left = std::chrono::ceil<milliseconds>(transfer->deadline - Clock::now());
+    if (left <= milliseconds::zero()) return transfer->finish(WebErrorKind::timedOut);
 
     transfer->response->body.clear();
     transfer->head = ResponseHead();
@@ -335,13 +379,16 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
     set(CURLOPT_FORBID_REUSE, 1L);
     set(CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_1_1));
     set(CURLOPT_CONNECTTIMEOUT_MS, static_cast<long>(settings_.connectLimit.count()));
-    if (left > milliseconds::zero()) set(CURLOPT_TIMEOUT_MS, static_cast<long>(left.count()));
+    set(CURLOPT_TIMEOUT_MS, static_cast<long>(left.count()));
     set(CURLOPT_LOW_SPEED_LIMIT, kStallBytesPerSecond);
     set(CURLOPT_LOW_SPEED_TIME, static_cast<long>(settings_.stallLimit.count()));
     set(CURLOPT_QUICK_EXIT, 1L);  // else a dead name server outlasts every limit
     set(CURLOPT_BUFFERSIZE, kReceiveBufferSize);
-    // What is announced is checked here, what comes in onBody().
+    // What is announced is checked here, what comes in onBody() and onProgress().
     set(CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(transfer.largestBody));
+    set(CURLOPT_NOPROGRESS, 0L);
+    set(CURLOPT_XFERINFOFUNCTION, &Transfer::onProgress);
+    set(CURLOPT_XFERINFODATA, &transfer);
     set(CURLOPT_HEADERFUNCTION, &Transfer::onHeader);
     set(CURLOPT_HEADERDATA, &transfer);
     set(CURLOPT_WRITEFUNCTION, &Transfer::onBody);
@@ -433,6 +480,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
 
   void act(curl_socket_t fd, int mask) {
     int running = 0;
+    NotingMemory::failed = false;
     // What failed of a transfer shows in the messages. Otherwise it lacked memory for its own books, and
     // libcurl 7.88 crashes when it goes on with them, as it does after a callback of ours refused.
     if (curl_multi_socket_action(multi_.get(), fd, mask, &running) != CURLM_OK) giveUpSoon();
@@ -516,8 +564,13 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
       case CURLE_WEIRD_SERVER_REPLY:
       case CURLE_UNSUPPORTED_PROTOCOL:
         return WebErrorKind::malformedResponse;
-      case CURLE_OUT_OF_MEMORY:
-        return WebErrorKind::outOfMemory;
+      case CURLE_OUT_OF_MEMORY: {
+        // Before TLS is set up it may be that library which lacks memory, and its heap is not noted.
+        curl_off_t tlsIsUpAfter = 0;
+        (void)curl_easy_getinfo(transfer.easy.get(), CURLINFO_APPCONNECT_TIME_T, &tlsIsUpAfter);
+        return NotingMemory::failed || tlsIsUpAfter == 0 ? WebErrorKind::outOfMemory
+                                                         : WebErrorKind::malformedResponse;
+      }
       case CURLE_ABORTED_BY_CALLBACK:
         return WebErrorKind::clientUnavailable;  // see giveUpSoon()
       default:

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <chrono>
+#include <cstdint>
 #include <memory>
 #include <string>
 
@@ -16,6 +17,10 @@ struct CurlSettings {
   std::string certificateAuthorities;  // a file of trusted certificates; empty: the system's
   std::chrono::milliseconds connectLimit = std::chrono::seconds(30);  // name, connection and TLS together
   std::chrono::seconds stallLimit = std::chrono::seconds(30);  // two at least: rates are taken over a second
+  // A request as a whole: so long, and what its largest body takes at the slowest rate. A real body is far
+  // smaller than the largest, so a slow link has time enough; a server that trickles has not.
+  std::chrono::milliseconds wholeLimit = std::chrono::minutes(1);
+  std::uint64_t slowestBytesPerSecond = std::uint64_t{64} << 10;
   CellularRuleFiles cellularFiles;
 };
 

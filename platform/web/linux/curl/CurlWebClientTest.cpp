@@ -341,6 +341,37 @@ TEST_F(CurlWebClientTest, TheRequestsOwnLimitEndsASteadyTransferAndCountsRedirec
   EXPECT_GE(std::chrono::steady_clock::now() - before, 149ms);  // libcurl counts whole milliseconds
 }
 
+TEST_F(CurlWebClientTest, ARequestAsAWholeHasTheTimeThatItsLargestBodyTakes) {
+  settings.wholeLimit = 100ms;
+  settings.slowestBytesPerSecond = 1'000'000;
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 200 OK\r\nContent-Length: 100\r\n\r\n");
+    connection.stall();
+  });
+  Options options;
+  options.largestBody = 200'000;
+  const auto before = std::chrono::steady_clock::now();
+  expectKind(WebErrorKind::timedOut, fetch(server.url(), options));
+  const auto taken = std::chrono::steady_clock::now() - before;
+  EXPECT_GE(taken, 299ms);  // libcurl counts whole milliseconds
+  EXPECT_LT(taken, 30s) << "that was the limit on stalling";
+}
+
+TEST_F(CurlWebClientTest, ASteadyTransferThatExceedsTheTimeOfTheWholeIsGivenUpWithoutALimitOfItsOwn) {
+  settings.wholeLimit = 150ms;
+  settings.slowestBytesPerSecond = ~std::uint64_t{0};
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 200 OK\r\nTransfer-Encoding: chunked\r\n\r\n");
+    const auto end = std::chrono::steady_clock::now() + 20s;
+    while (std::chrono::steady_clock::now() < end && connection.write("1\r\nx\r\n"))
+      std::this_thread::yield();
+    connection.write("0\r\n\r\n");
+  });
+  expectKind(WebErrorKind::timedOut, fetch(server.url()));
+}
+
 TEST_F(CurlWebClientTest, AConnectionResetOrCutIsTold) {
   HttpsServer server(identity, [](Connection& connection) {
     const auto request = connection.readRequest();
@@ -422,6 +453,31 @@ TEST_F(CurlWebClientTest, HeadersWithoutEndAreMalformed) {
   expectKind(WebErrorKind::malformedResponse, fetch(server.url()));
 }
 
+TEST_F(CurlWebClientTest, AHeaderLineThatIsTooLongIsMalformedAndNoLackOfMemory) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 200 OK\r\nX-Filler: " + std::string(150'000, 'x') +
+                     "\r\nContent-Length: 1\r\n\r\nx");
+    connection.finishTls();
+  });
+  expectKind(WebErrorKind::malformedResponse, fetch(server.url()));
+}
+
+TEST_F(CurlWebClientTest, AFoldedHeaderIsOneField) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 200 OK\r\nContent-Type: application/x-tar;\r\n  a: gzip \r\n\tb\r\n");
+    connection.write(
+        "Empty:\r\n \r\n\tnot quite\r\nTwice: 1\r\nTwice: 2\r\n more\r\nContent-Length: 1\r\n\r\nx");
+  });
+  const auto response = fetch(server.url());
+  expectKind(WebErrorKind::none, response);
+  EXPECT_EQ(response->headers, (HeaderMap{{"Content-Type", "application/x-tar; a: gzip b"},
+                                          {"Empty", "not quite"},
+                                          {"Twice", "1, 2 more"},
+                                          {"Content-Length", "1"}}));
+}
+
 TEST_F(CurlWebClientTest, ABodyBeyondTheLimitIsRefusedAnnouncedOrNot) {
   HttpsServer server(identity, [](Connection& connection) {
     const auto request = connection.readRequest();
@@ -455,6 +511,24 @@ TEST_F(CurlWebClientTest, TheLimitCountsDecodedBytes) {
   HttpsServer server(identity, [&](Connection& connection) {
     connection.readRequest();
     connection.respond("200 OK\r\nContent-Encoding: gzip", bomb);
+  });
+  Options options;
+  options.headers = {{"Accept-Encoding", "gzip"}};
+  options.largestBody = 1'000'000;
+  expectKind(WebErrorKind::bodyTooLarge, fetch(server.url(), options));
+}
+
+TEST_F(CurlWebClientTest, TheLimitCountsEncodedBytesTooSoThatABodyWithoutOutputEnds) {
+  // A gzip stream of empty blocks: it is well formed, never ends, and decodes to nothing.
+  const std::string header = gzip("").substr(0, 10);
+  std::string empty;
+  for (int i = 0; i < 20'000; ++i) empty += std::string("\0\0\0\xFF\xFF", 5);
+  HttpsServer server(identity, [&](Connection& connection) {
+    connection.readRequest();
+    connection.write("HTTP/1.1 200 OK\r\nContent-Encoding: gzip\r\nConnection: close\r\n\r\n" + header);
+    for (int i = 0; i < 100 && connection.write(empty); ++i) {
+    }
+    connection.finishTls();
   });
   Options options;
   options.headers = {{"Accept-Encoding", "gzip"}};
@@ -505,6 +579,17 @@ TEST_F(CurlWebClientTest, ARedirectToHttpIsRefusedAndNobodyIsAsked) {
   expectKind(WebErrorKind::redirectRefused, response);
   EXPECT_EQ(response->statusCode, 301);
   EXPECT_EQ(plain.connections(), 0);
+}
+
+TEST_F(CurlWebClientTest, TheBodyOfARedirectIsReadUpTo64KiB) {
+  HttpsServer server(identity, [](Connection& connection) {
+    const auto request = connection.readRequest();
+    if (request.starts_with("GET /target ")) return connection.respond("200 OK", "arrived");
+    const bool exact = request.find("/exact") != std::string::npos;
+    connection.respond("302 Found\r\nLocation: /target", std::string((64 << 10) + (exact ? 0 : 1), 'x'));
+  });
+  EXPECT_EQ(textOf(*fetch(server.url("/exact"))), "arrived");
+  expectKind(WebErrorKind::bodyTooLarge, fetch(server.url("/more")));
 }
 
 TEST_F(CurlWebClientTest, RedirectsThatDoNotEndAreGivenUp) {

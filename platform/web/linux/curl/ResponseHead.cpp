@@ -42,10 +42,20 @@ bool ResponseHead::takeLine(std::string_view line) {
   if (taken_ > kLargest) return false;
   if (bodyHasBegun_) return true;
   if (line.starts_with("HTTP/")) fields.clear();  // of an interim response before this one
+  if (line.starts_with(' ') || line.starts_with('\t')) {
+    const auto more = trimmed(line);
+    const auto field = fields.find(lastName_);
+    if (more.empty() || lastName_.empty() || field == fields.end()) return true;
+    if (!field->second.empty()) field->second += ' ';
+    field->second += more;
+    return true;
+  }
+  lastName_.clear();
   const auto colon = line.find(':');
   if (colon == std::string_view::npos || colon == 0) return true;
   const auto value = trimmed(line.substr(colon + 1));
-  const auto [at, isNew] = fields.try_emplace(std::string(trimmed(line.substr(0, colon))), value);
+  lastName_ = trimmed(line.substr(0, colon));
+  const auto [at, isNew] = fields.try_emplace(lastName_, value);
   if (!isNew) at->second.append(", ").append(value);
   return true;
 }

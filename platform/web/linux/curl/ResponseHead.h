@@ -18,7 +18,8 @@ class ResponseHead {
   // Of all lines of one attempt together; a sane server stays far below.
   static constexpr std::size_t kLargest = std::size_t{256} * 1024;
 
-  // False when that is too much. A line that starts a response, after an interim one, starts anew.
+  // False when that is too much. A line that starts a response, after an interim one, starts anew. A line
+  // that begins with a blank goes on with the field before it (RFC 9112, 5.2).
   bool takeLine(std::string_view line);
   // From here on lines are trailers, which are not taken.
   void bodyBegins() noexcept { bodyHasBegun_ = true; }
@@ -28,6 +29,7 @@ class ResponseHead {
 
  private:
   std::size_t taken_ = 0;
+  std::string lastName_;  // of the field that a folded line would belong to; empty: none
   bool bodyHasBegun_ = false;
 };
 
