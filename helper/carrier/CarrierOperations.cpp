@@ -12,6 +12,7 @@
 #include <exception>
 #include <string>
 
+#include "platform/base/UniqueFd.h"
 #include "platform/base/Utf8.h"
 #include "platform/log/Log.h"
 
@@ -34,6 +35,27 @@ KernelReturn guarded(KernelReturn onException, Work work) noexcept {
     return onException;
   }
 }
+
+// What stands at a path, links not followed. Holds it, so that nothing new is taken for it: the number of an
+// item that is gone may be given to another.
+class StandingItem {
+ public:
+  explicit StandingItem(const std::string& path)
+      : fd_(::open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC)),
+        isThere_(fd_.isValid() && ::fstat(fd_.get(), &info_) == 0) {}
+
+  // Whether the same item stands at the path, or nothing does, as when this object was made.
+  bool standsAt(const std::string& path) const {
+    struct stat now {};
+    if (::lstat(path.c_str(), &now) != 0) return !isThere_;
+    return isThere_ && now.st_dev == info_.st_dev && now.st_ino == info_.st_ino;
+  }
+
+ private:
+  const UniqueFd fd_;
+  struct stat info_ {};
+  const bool isThere_;
+};
 
 // Makes the link under a free name in the directory; empty when there is none to be had.
 std::string makeHiddenLink(const char* target, const std::string& directory) {
@@ -131,8 +153,17 @@ KernelReturn CarrierOperations::copyCarrierFile(PortName, char* sourceDirectory,
       return kern::success;
     }
     const std::unique_ptr<FileSystemInterface> fileSystem = fileSystems_();
+    const std::string source = std::string(sourceDirectory) + "/" + fileName;
+    // Onto a directory the file is copied into it.
+    const std::string copied = fileSystem && fileSystem->isDirectory(destination)
+                                   ? destination + "/" + fileSystem->baseName(source)
+                                   : destination;
+    const StandingItem before(copied);
     if (fileSystem &&
         fileSystem->copyFileIntoDirectory(sourceDirectory, destinationDirectory, fileName) == 0) {
+      // The copy of a file onto another reports no failure: only a new file at the place tells that it was
+      // made.
+      if (!fileSystem->isDirectory(source) && before.standsAt(copied)) return kern::success;
       const MobileAccount account = account_();
       // A link was copied as a link, and is given away as one: what it points to is not ours to give.
       *success = ::lchown(destination.c_str(), account.uid, account.gid) == 0;

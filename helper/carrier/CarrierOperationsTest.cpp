@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -313,15 +314,60 @@ TEST_F(CarrierOperationsTest, CopyCarrierFileSucceedsOnlyIfTheOwnerCanBeSet) {
   EXPECT_EQ(contentOf(bundles("/file")), "content");
 }
 
-TEST_F(CarrierOperationsTest, CopyCarrierFileWithAnUnreportedMergeFailureHangsOnTheOwnerAlone) {
+TEST_F(CarrierOperationsTest, CopyCarrierFileThatKeepsTheOldFileIsNoSuccessAndWritesNoLine) {
   elsewhere.file("file", "new");
-  home.file("Library/Carrier Bundles/file", "old");
+  const std::string old = home.file("Library/Carrier Bundles/file", "old");
+  if (::geteuid() == 0) account.uid = account.gid = 4711;
   files.fail("copyItem", FileOutcome::failure(EIO));
   EXPECT_EQ(operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
                                        Short("file").data(), &success),
             0);
+  EXPECT_EQ(success, 0);
+  EXPECT_EQ(contentOf(old), "old");
+  EXPECT_EQ(statOf(old).st_uid, ::getuid());  // nor is the old file given away
+  EXPECT_EQ(
+      log.entries(),
+      (std::vector{
+          Log::bsdLine(SyslogPriority::notice, "'" + elsewhere.path() + "', '" + bundles("") + "', 'file'\n"),
+          Log::unifiedLine(LogLevel::info, "Allowing path " + old + " within " + bundles("/"))}));
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileOfWhatIsNoFileOverAFileIsNoSuccess) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to make a device node";
+  if (::mknod((elsewhere / "device").c_str(), S_IFCHR | 0666, makedev(1, 3)) != 0)
+    GTEST_SKIP() << "no nodes here";
+  const std::string old = home.file("Library/Carrier Bundles/device", "old");
+  EXPECT_EQ(operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                       Short("device").data(), &success),
+            0);
+  EXPECT_EQ(success, 0);
+  EXPECT_EQ(contentOf(old), "old");
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileOntoADirectoryTellsOfTheFileInside) {
+  elsewhere.file("name", "new");
+  const std::string inside = home.file("Library/Carrier Bundles/name/name", "old");
+  const auto copy = [&] {
+    (void)operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                     Short("name").data(), &success);
+    return success;
+  };
+  files.fail("copyItem", FileOutcome::failure(EIO));
+  EXPECT_EQ(copy(), 0);
+  EXPECT_EQ(contentOf(inside), "old");
+  files.recover("copyItem");
+  EXPECT_EQ(copy(), 1);
+  EXPECT_EQ(contentOf(inside), "new");
+  EXPECT_EQ(copy(), 1);  // over a file with the same content
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileOntoItselfSucceeds) {
+  const std::string file = home.file("Library/Carrier Bundles/file", "kept");
+  EXPECT_EQ(operations.copyCarrierFile(kPort, Short(bundles("")).data(), Short(bundles("")).data(),
+                                       Short("file").data(), &success),
+            0);
   EXPECT_EQ(success, 1);
-  EXPECT_EQ(contentOf(bundles("/file")), "old");
+  EXPECT_EQ(contentOf(file), "kept");
 }
 
 TEST_F(CarrierOperationsTest, CopyCarrierFileGivesALinkAwayAndNotWhatItPointsTo) {

@@ -24,6 +24,11 @@ class FaultyFileManager final : public FileManager {
     partOf_[operation] = part;
     fail(operation, outcome);
   }
+  // From now on the operation is the real one again.
+  void recover(const std::string& operation) {
+    faults_.erase(operation);
+    partOf_.erase(operation);
+  }
 
   std::vector<std::string> calls;  // "operation path [path]"
   int openScopes = 0;
