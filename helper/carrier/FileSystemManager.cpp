@@ -113,6 +113,9 @@ class FileSystemManager::Merge final : public ItemVisitor {
  private:
   Next transferItem(const std::string& subpath, bool isDirectory) {
     const std::string from = source_ + "/" + subpath;
+    // A source that holds the destination would be copied into itself, and what was copied again, without
+    // end.
+    if (isDirectory && isDestination(from)) return Next::skipBelow;
     const std::string to = destination_ + "/" + subpath;
     bool fromIsDirectory = false;
     bool toIsDirectory = false;
@@ -131,6 +134,13 @@ class FileSystemManager::Merge final : public ItemVisitor {
     if (lacksMemory(outcome)) lackedMemory_ = true;
     // Below a link the items would be written to wherever it points.
     return isDirectory && owner_.isSymbolicLink(to) ? Next::skipBelow : Next::descend;
+  }
+
+  bool isDestination(const std::string& directory) const {
+    struct stat here {};
+    struct stat there {};
+    return ::lstat(directory.c_str(), &here) == 0 && ::stat(destination_.c_str(), &there) == 0 &&
+           here.st_dev == there.st_dev && here.st_ino == there.st_ino;
   }
 
   FileSystemManager& owner_;
