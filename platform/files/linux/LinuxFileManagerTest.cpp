@@ -339,6 +339,21 @@ TEST_F(LinuxFileManagerTest, LargeAndSparseFilesAreCopiedByteForByte) {
   EXPECT_LT(statOf(dir / "sparse-copy").st_blocks * 512, 2 << 20);
 }
 
+TEST_F(LinuxFileManagerTest, AFileThatSaysItIsEmptyOrLongerIsCopiedToItsEnd) {
+  for (const char* const source :
+       {"/proc/version", "/sys/kernel/mm/transparent_hugepage/enabled", "/proc/sys/kernel/ostype"}) {
+    const std::string content = contentOf(source);
+    if (content == "(none)") continue;
+    const std::string name = std::to_string(names("").size());
+    EXPECT_EQ(files.copyItem(source, dir / name, IfPresent::fail), kSuccess) << source;
+    EXPECT_EQ(contentOf(dir / name), content) << source;
+  }
+  EXPECT_FALSE(names("").empty());
+  dir.file("empty");
+  EXPECT_EQ(copy("empty", "empty-copy"), kSuccess);
+  EXPECT_EQ(contentOf(dir / "empty-copy"), "");
+}
+
 TEST_F(LinuxFileManagerTest, ATreeDeeperThanTheProcessHasDescriptorsIsCopiedListedAndRemoved) {
   constexpr int kDepth = 1500;
   const std::string top = dir.directory("deep");
