@@ -131,6 +131,7 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
     *wasAnswered = writer.wasStoppedByAnswer();
     if (error != 0) return error;
   }
+  if (const int error = writer.finish(); error != 0) return error;
   if (existing.isValid()) {
     if (const int error = checkMerge(stage.get(), existing.get()); error != 0) return error;
     return mergeStaged(stage.get(), existing.get());
