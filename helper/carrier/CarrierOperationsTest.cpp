@@ -92,21 +92,26 @@ TEST_F(CarrierOperationsTest, ALinkThatCannotBeMadeLeavesWhatWasThere) {
   EXPECT_EQ(contentOf(file), "kept");
 }
 
-TEST_F(CarrierOperationsTest, ALeftoverOfAKilledReplacementIsNoObstacle) {
+TEST_F(CarrierOperationsTest, ItemsOfStrangersUnderHiddenNamesAreNoObstacleAndStay) {
   const std::string file = elsewhere.file("file", "old");
-  elsewhere.link(".brenvik-link-0", "left behind");
+  for (int number = 0; number < 8; ++number) {
+    elsewhere.file(".brenvik-link-" + std::to_string(number), "kept");
+  }
+  elsewhere.file(".brenvik-0123456789abcdef/planted", "kept");
   EXPECT_EQ(operations.createSymlink(kPort, Long("new").data(), Long(file).data()), 0);
   EXPECT_EQ(std::filesystem::read_symlink(file), "new");
-  EXPECT_FALSE(isThere(elsewhere / ".brenvik-link-0"));
+  for (int number = 0; number < 8; ++number) {
+    EXPECT_EQ(contentOf(elsewhere / (".brenvik-link-" + std::to_string(number))), "kept");
+  }
+  EXPECT_EQ(contentOf(elsewhere / ".brenvik-0123456789abcdef/planted"), "kept");
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(elsewhere.path()), {}), 10);
 }
 
-TEST_F(CarrierOperationsTest, ADirectoryPlantedUnderTheHiddenNameIsNoObstacle) {
-  const std::string file = elsewhere.file("file", "old");
-  elsewhere.file(".brenvik-link-0/planted", "x");
-  EXPECT_EQ(operations.createSymlink(kPort, Long("new").data(), Long(file).data()), 0);
-  EXPECT_EQ(std::filesystem::read_symlink(file), "new");
-  EXPECT_FALSE(isThere(elsewhere / ".brenvik-link-1"));
-  EXPECT_TRUE(isThere(elsewhere / ".brenvik-link-0/planted"));
+TEST_F(CarrierOperationsTest, ALinkThatCannotBeMadeLeavesAnEmptyDirectoryToo) {
+  const std::string empty = elsewhere.directory("empty");
+  EXPECT_EQ(operations.createSymlink(kPort, Long("").data(), Long(empty).data()), 5);
+  EXPECT_EQ(operations.createSymlink(kPort, Long("t").data(), Long(empty + "/").data()), 5);
+  EXPECT_TRUE(std::filesystem::is_directory(empty));
 }
 
 TEST_F(CarrierOperationsTest, UnterminatedFieldsAreCutAtTheirLastByte) {
@@ -359,6 +364,16 @@ TEST_F(CarrierOperationsTest, CopyCarrierFileOntoADirectoryTellsOfTheFileInside)
   EXPECT_EQ(copy(), 1);
   EXPECT_EQ(contentOf(inside), "new");
   EXPECT_EQ(copy(), 1);  // over a file with the same content
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileSucceedsOnlyWhenTheFileIsOnTheDisk) {
+  elsewhere.file("file", "content");
+  home.directory("Library/Carrier Bundles");
+  files.fail("syncItem", FileOutcome::failure(EIO));
+  EXPECT_EQ(operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                       Short("file").data(), &success),
+            0);
+  EXPECT_EQ(success, 0);
 }
 
 TEST_F(CarrierOperationsTest, CopyCarrierFileOntoItselfSucceeds) {
