@@ -7,11 +7,10 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstdio>
-#include <cstring>
 #include <exception>
 #include <string>
 
+#include "platform/base/UniqueFd.h"
 #include "platform/base/Utf8.h"
 #include "platform/log/Log.h"
 
@@ -20,8 +19,6 @@ namespace {
 
 constexpr mode_t kBundlesDirectoryMode = 0755;
 constexpr const char* kCrashLogs = "Library/Logs/CrashReporter/";
-constexpr const char* kLinkInTheMaking = "/.brenvik-link-";
-constexpr int kHiddenNames = 4;
 
 void terminate(char* field, std::size_t size) { field[size - 1] = '\0'; }
 
@@ -35,39 +32,33 @@ KernelReturn guarded(KernelReturn onException, Work work) noexcept {
   }
 }
 
-// Makes the link under a free name in the directory; empty when there is none to be had.
-std::string makeHiddenLink(const char* target, const std::string& directory) {
-  for (int number = 0; number < kHiddenNames; ++number) {
-    std::string path = directory + kLinkInTheMaking + std::to_string(number);
-    if (::symlink(target, path.c_str()) == 0) return path;
-    if (errno != EEXIST) return {};
-    // One that a killed process has left goes; what somebody put there to be in the way costs one name.
-    if (::unlink(path.c_str()) == 0 && ::symlink(target, path.c_str()) == 0) return path;
+// What stands at a path, links not followed. Holds it, so that nothing new is taken for it: the number of an
+// item that is gone may be given to another.
+class StandingItem {
+ public:
+  explicit StandingItem(const std::string& path)
+      : fd_(::open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC)),
+        isThere_(fd_.isValid() && ::fstat(fd_.get(), &info_) == 0) {}
+
+  // Whether the same item stands at the path, or nothing does, as when this object was made.
+  bool standsAt(const std::string& path) const {
+    struct stat now {};
+    if (::lstat(path.c_str(), &now) != 0) return !isThere_;
+    return isThere_ && now.st_dev == info_.st_dev && now.st_ino == info_.st_ino;
   }
-  return {};
-}
 
-// Puts a new link where something else stands, in one step, so that a kill or a full disk leaves the old or
-// the new.
-bool exchangeForLink(const char* target, const char* linkPath) {
-  const std::string path = linkPath;
-  const std::size_t slash = path.rfind('/');
-  const std::string hidden = makeHiddenLink(target, slash == std::string::npos ? "." : path.substr(0, slash));
-  if (hidden.empty()) return false;
-  if (::rename(hidden.c_str(), linkPath) == 0) return true;
-  (void)::unlink(hidden.c_str());  // the failure of the rename is the answer
-  return false;
-}
-
-// True when the link stands at its path in the end.
-bool replaceByLink(const char* target, const char* linkPath) {
-  struct stat there {};
-  if (::lstat(linkPath, &there) == 0 && !S_ISDIR(there.st_mode)) return exchangeForLink(target, linkPath);
-  (void)std::remove(linkPath);  // it need not exist; a directory goes only when it is empty
-  return ::symlink(target, linkPath) == 0;
-}
+ private:
+  const UniqueFd fd_;
+  struct stat info_ {};
+  const bool isThere_;
+};
 
 }  // namespace
+
+KernelReturn CarrierOperations::placeLink(const char* target, const char* linkPath) {
+  const std::unique_ptr<FileSystemInterface> fileSystem = fileSystems_();
+  return fileSystem && fileSystem->placeLink(linkPath, target) == 0 ? kern::success : kern::failure;
+}
 
 void CarrierOperations::flushDomain(const char* domain) {
   if (!isValidUtf8(domain)) {
@@ -82,7 +73,7 @@ KernelReturn CarrierOperations::createSymlink(PortName, char* target, char* link
   return guarded(kern::failure, [&] {
     terminate(target, kLongField);
     terminate(linkPath, kLongField);
-    return replaceByLink(target, linkPath) ? kern::success : kern::failure;
+    return placeLink(target, linkPath);
   });
 }
 
@@ -96,7 +87,7 @@ KernelReturn CarrierOperations::replaceCarrierSymlink(PortName, char* target, ch
       logUnified(LogLevel::error, "Cannot remove symlink: %s", linkPath);
       return kern::noAccess;
     }
-    if (!replaceByLink(target, linkPath)) return kern::failure;
+    if (const KernelReturn failed = placeLink(target, linkPath); failed != kern::success) return failed;
     logUnified(LogLevel::info, "linkpath: %s, domain: %s", linkPath, domain);
     if (domain[0] != '\0') flushDomain(domain);
     return kern::success;
@@ -112,7 +103,8 @@ KernelReturn CarrierOperations::removeCarrierFile(PortName, char* path, char* do
       flushDomain(domain);
     }
     if (!policy_.isAllowedCarrierPath(path)) return kern::noAccess;
-    return std::remove(path) == 0 ? kern::success : kern::failure;
+    const std::unique_ptr<FileSystemInterface> fileSystem = fileSystems_();
+    return fileSystem && fileSystem->removeEntry(path) == 0 ? kern::success : kern::failure;
   });
 }
 
@@ -131,11 +123,21 @@ KernelReturn CarrierOperations::copyCarrierFile(PortName, char* sourceDirectory,
       return kern::success;
     }
     const std::unique_ptr<FileSystemInterface> fileSystem = fileSystems_();
+    const std::string source = std::string(sourceDirectory) + "/" + fileName;
+    // Onto a directory the file is copied into it.
+    const std::string copied = fileSystem && fileSystem->isDirectory(destination)
+                                   ? destination + "/" + fileSystem->baseName(source)
+                                   : destination;
+    const StandingItem before(copied);
     if (fileSystem &&
         fileSystem->copyFileIntoDirectory(sourceDirectory, destinationDirectory, fileName) == 0) {
+      // The copy of a file onto another reports no failure: only a new file at the place tells that it was
+      // made.
+      if (!fileSystem->isDirectory(source) && before.standsAt(copied)) return kern::success;
       const MobileAccount account = account_();
       // A link was copied as a link, and is given away as one: what it points to is not ours to give.
-      *success = ::lchown(destination.c_str(), account.uid, account.gid) == 0;
+      *success = ::lchown(destination.c_str(), account.uid, account.gid) == 0 &&
+                 fileSystem->syncItem(destination) == 0;
     } else {
       logBsd(SyslogPriority::error, "Failed to copy the file %s to %s\n", sourceDirectory,
              destinationDirectory);

@@ -57,6 +57,7 @@ class CarrierOperations {
                              std::uint8_t* success) noexcept;
 
  private:
+  KernelReturn placeLink(const char* target, const char* linkPath);
   void flushDomain(const char* domain);
 
   const FileSystemFactory fileSystems_;

@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -91,21 +92,26 @@ TEST_F(CarrierOperationsTest, ALinkThatCannotBeMadeLeavesWhatWasThere) {
   EXPECT_EQ(contentOf(file), "kept");
 }
 
-TEST_F(CarrierOperationsTest, ALeftoverOfAKilledReplacementIsNoObstacle) {
+TEST_F(CarrierOperationsTest, ItemsOfStrangersUnderHiddenNamesAreNoObstacleAndStay) {
   const std::string file = elsewhere.file("file", "old");
-  elsewhere.link(".brenvik-link-0", "left behind");
+  for (int number = 0; number < 8; ++number) {
+    elsewhere.file(".brenvik-link-" + std::to_string(number), "kept");
+  }
+  elsewhere.file(".brenvik-0123456789abcdef/planted", "kept");
   EXPECT_EQ(operations.createSymlink(kPort, Long("new").data(), Long(file).data()), 0);
   EXPECT_EQ(std::filesystem::read_symlink(file), "new");
-  EXPECT_FALSE(isThere(elsewhere / ".brenvik-link-0"));
+  for (int number = 0; number < 8; ++number) {
+    EXPECT_EQ(contentOf(elsewhere / (".brenvik-link-" + std::to_string(number))), "kept");
+  }
+  EXPECT_EQ(contentOf(elsewhere / ".brenvik-0123456789abcdef/planted"), "kept");
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(elsewhere.path()), {}), 10);
 }
 
-TEST_F(CarrierOperationsTest, ADirectoryPlantedUnderTheHiddenNameIsNoObstacle) {
-  const std::string file = elsewhere.file("file", "old");
-  elsewhere.file(".brenvik-link-0/planted", "x");
-  EXPECT_EQ(operations.createSymlink(kPort, Long("new").data(), Long(file).data()), 0);
-  EXPECT_EQ(std::filesystem::read_symlink(file), "new");
-  EXPECT_FALSE(isThere(elsewhere / ".brenvik-link-1"));
-  EXPECT_TRUE(isThere(elsewhere / ".brenvik-link-0/planted"));
+TEST_F(CarrierOperationsTest, ALinkThatCannotBeMadeLeavesAnEmptyDirectoryToo) {
+  const std::string empty = elsewhere.directory("empty");
+  EXPECT_EQ(operations.createSymlink(kPort, Long("").data(), Long(empty).data()), 5);
+  EXPECT_EQ(operations.createSymlink(kPort, Long("t").data(), Long(empty + "/").data()), 5);
+  EXPECT_TRUE(std::filesystem::is_directory(empty));
 }
 
 TEST_F(CarrierOperationsTest, UnterminatedFieldsAreCutAtTheirLastByte) {
@@ -313,15 +319,70 @@ TEST_F(CarrierOperationsTest, CopyCarrierFileSucceedsOnlyIfTheOwnerCanBeSet) {
   EXPECT_EQ(contentOf(bundles("/file")), "content");
 }
 
-TEST_F(CarrierOperationsTest, CopyCarrierFileWithAnUnreportedMergeFailureHangsOnTheOwnerAlone) {
+TEST_F(CarrierOperationsTest, CopyCarrierFileThatKeepsTheOldFileIsNoSuccessAndWritesNoLine) {
   elsewhere.file("file", "new");
-  home.file("Library/Carrier Bundles/file", "old");
+  const std::string old = home.file("Library/Carrier Bundles/file", "old");
+  if (::geteuid() == 0) account.uid = account.gid = 4711;
   files.fail("copyItem", FileOutcome::failure(EIO));
   EXPECT_EQ(operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
                                        Short("file").data(), &success),
             0);
+  EXPECT_EQ(success, 0);
+  EXPECT_EQ(contentOf(old), "old");
+  EXPECT_EQ(statOf(old).st_uid, ::getuid());  // nor is the old file given away
+  EXPECT_EQ(
+      log.entries(),
+      (std::vector{
+          Log::bsdLine(SyslogPriority::notice, "'" + elsewhere.path() + "', '" + bundles("") + "', 'file'\n"),
+          Log::unifiedLine(LogLevel::info, "Allowing path " + old + " within " + bundles("/"))}));
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileOfWhatIsNoFileOverAFileIsNoSuccess) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to make a device node";
+  if (::mknod((elsewhere / "device").c_str(), S_IFCHR | 0666, makedev(1, 3)) != 0)
+    GTEST_SKIP() << "no nodes here";
+  const std::string old = home.file("Library/Carrier Bundles/device", "old");
+  EXPECT_EQ(operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                       Short("device").data(), &success),
+            0);
+  EXPECT_EQ(success, 0);
+  EXPECT_EQ(contentOf(old), "old");
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileOntoADirectoryTellsOfTheFileInside) {
+  elsewhere.file("name", "new");
+  const std::string inside = home.file("Library/Carrier Bundles/name/name", "old");
+  const auto copy = [&] {
+    (void)operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                     Short("name").data(), &success);
+    return success;
+  };
+  files.fail("copyItem", FileOutcome::failure(EIO));
+  EXPECT_EQ(copy(), 0);
+  EXPECT_EQ(contentOf(inside), "old");
+  files.recover("copyItem");
+  EXPECT_EQ(copy(), 1);
+  EXPECT_EQ(contentOf(inside), "new");
+  EXPECT_EQ(copy(), 1);  // over a file with the same content
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileSucceedsOnlyWhenTheFileIsOnTheDisk) {
+  elsewhere.file("file", "content");
+  home.directory("Library/Carrier Bundles");
+  files.fail("syncItem", FileOutcome::failure(EIO));
+  EXPECT_EQ(operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                       Short("file").data(), &success),
+            0);
+  EXPECT_EQ(success, 0);
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileOntoItselfSucceeds) {
+  const std::string file = home.file("Library/Carrier Bundles/file", "kept");
+  EXPECT_EQ(operations.copyCarrierFile(kPort, Short(bundles("")).data(), Short(bundles("")).data(),
+                                       Short("file").data(), &success),
+            0);
   EXPECT_EQ(success, 1);
-  EXPECT_EQ(contentOf(bundles("/file")), "old");
+  EXPECT_EQ(contentOf(file), "kept");
 }
 
 TEST_F(CarrierOperationsTest, CopyCarrierFileGivesALinkAwayAndNotWhatItPointsTo) {

@@ -149,6 +149,9 @@ class Model {
     for (const std::string& name : names) {
       const std::string from = source + below + "/" + name;
       const std::string to = destination + below + "/" + name;
+      // What is being filled is not taken along.
+      const Node* item = find(from, false);
+      if (item != nullptr && item == find(destination, true)) continue;
       if (exists(from) && exists(to) && !isDirectory(from) && !isDirectory(to)) removeItem(to);
       makeDirectories(to.substr(0, to.rfind('/')));
       (void)whole(mode, from, to);

@@ -75,6 +75,13 @@ class FileSystemInterface {
   virtual bool isDirectory(const std::string& path) noexcept = 0;
   // Truncates what is there.
   virtual bool createEmptyFile(const std::string& path) noexcept = 0;
+
+  // What the requests need beyond the slots above. Each is on the disk when it succeeds.
+  // A link where nothing, a file, a link or an empty directory stands; what was there stays when it fails.
+  virtual int placeLink(const std::string& linkPath, const std::string& target) noexcept = 0;
+  // A file, a link or an empty directory.
+  virtual int removeEntry(const std::string& path) noexcept = 0;
+  virtual int syncItem(const std::string& path) noexcept = 0;
 };
 
 // Makes the object of one request; null when memory is exhausted. Called and used on the main thread.

@@ -66,19 +66,19 @@ FileSystemFactory FileSystemManager::factory(FileManager& files) {
 }
 
 FileOutcome FileSystemManager::transfer(Mode mode, const std::string& source, const std::string& destination,
-                                        IfPresent ifPresent) {
-  return mode == Mode::move ? files().moveItem(source, destination, ifPresent)
-                            : files().copyItem(source, destination, ifPresent);
+                                        IfPresent ifPresent, Durability durability) {
+  return mode == Mode::move ? files().moveItem(source, destination, ifPresent, durability)
+                            : files().copyItem(source, destination, ifPresent, durability);
 }
 
 int FileSystemManager::copyOrMove(Mode mode, const std::string& source, const std::string& destination,
-                                  uid_t uid, gid_t gid) {
+                                  uid_t uid, gid_t gid, Durability durability) {
   struct stat info {};
   if (::stat(source.c_str(), &info) != 0) return kPosixFailure;
   bool destinationIsDirectory = false;
   if (!files().itemExists(destination, &destinationIsDirectory)) {
     (void)!::chown(source.c_str(), uid, gid);  // an item that cannot be given away is still transferred
-    return transfer(mode, source, destination, IfPresent::fail).codeOr(kUnexplained);
+    return transfer(mode, source, destination, IfPresent::fail, durability).codeOr(kUnexplained);
   }
   if (!destinationIsDirectory && S_ISDIR(info.st_mode)) return EEXIST;
 
@@ -91,7 +91,7 @@ int FileSystemManager::copyOrMove(Mode mode, const std::string& source, const st
     gives = files().itemExists(effective, &isDirectoryThere) && !isDirectoryThere;
   }
   (void)!::chown(source.c_str(), uid, gid);
-  return merge(mode, source, effective, gives ? IfPresent::replaceNonDirectory : IfPresent::fail);
+  return merge(mode, source, effective, gives ? IfPresent::replaceNonDirectory : IfPresent::fail, durability);
 }
 
 // Takes the items below the source of a merge to the destination, one by one.
@@ -113,6 +113,9 @@ class FileSystemManager::Merge final : public ItemVisitor {
  private:
   Next transferItem(const std::string& subpath, bool isDirectory) {
     const std::string from = source_ + "/" + subpath;
+    // A source that holds the destination would be copied into itself, and what was copied again, without
+    // end.
+    if (isDirectory && isDestination(from)) return Next::skipBelow;
     const std::string to = destination_ + "/" + subpath;
     bool fromIsDirectory = false;
     bool toIsDirectory = false;
@@ -126,11 +129,19 @@ class FileSystemManager::Merge final : public ItemVisitor {
     // Replaced in one step: a full disk or a kill leaves the old file or the new one.
     const FileOutcome outcome = owner_.transfer(
         mode_, from, to,
-        bothExist && !fromIsDirectory && !toIsDirectory ? IfPresent::replaceNonDirectory : IfPresent::fail);
+        bothExist && !fromIsDirectory && !toIsDirectory ? IfPresent::replaceNonDirectory : IfPresent::fail,
+        Durability::eventual);  // thousands of files: the disk is waited for once, at the end
     if (outcome.succeeded()) return Next::skipBelow;  // a directory came over with all that is in it
     if (lacksMemory(outcome)) lackedMemory_ = true;
     // Below a link the items would be written to wherever it points.
     return isDirectory && owner_.isSymbolicLink(to) ? Next::skipBelow : Next::descend;
+  }
+
+  bool isDestination(const std::string& directory) const {
+    struct stat here {};
+    struct stat there {};
+    return ::lstat(directory.c_str(), &here) == 0 && ::stat(destination_.c_str(), &there) == 0 &&
+           here.st_dev == there.st_dev && here.st_ino == there.st_ino;
   }
 
   FileSystemManager& owner_;
@@ -143,8 +154,8 @@ class FileSystemManager::Merge final : public ItemVisitor {
 
 // 0 whatever fails, but for a lack of memory: then nobody knows what could have been transferred.
 int FileSystemManager::merge(Mode mode, const std::string& source, const std::string& destination,
-                             IfPresent ifPresent) {
-  const FileOutcome whole = transfer(mode, source, destination, ifPresent);
+                             IfPresent ifPresent, Durability durability) {
+  const FileOutcome whole = transfer(mode, source, destination, ifPresent, durability);
   if (whole.succeeded()) return 0;
   if (lacksMemory(whole)) return ENOMEM;
   bool lackedMemory = false;
@@ -157,6 +168,8 @@ int FileSystemManager::merge(Mode mode, const std::string& source, const std::st
     Merge items(*this, mode, source, destination);
     const FileOutcome below = files().enumerateBelow(source, items);
     lackedMemory = items.lackedMemory() || lacksMemory(below);
+    if (durability == Durability::onReturn)
+      (void)files().syncItem(destination);  // a merge reports no failure
   }
   // Of a copied directory, too: it goes if it is empty.
   (void)::rmdir(source.c_str());
@@ -176,7 +189,7 @@ int FileSystemManager::moveDirectory(const std::string& source, const std::strin
   struct stat info {};
   if (::stat(source.c_str(), &info) != 0) return kPosixFailure;
   (void)setOwner(source, ::getuid(), ::getgid(), true);  // what keeps its owner is moved all the same
-  return files().moveItem(source, destination, IfPresent::fail).codeOr(kUnexplained);
+  return files().moveItem(source, destination, IfPresent::fail, Durability::onReturn).codeOr(kUnexplained);
 }
 
 int FileSystemManager::copyItem(const std::string& source, const std::string& destination) noexcept {
@@ -191,7 +204,7 @@ int FileSystemManager::copyFileIntoDirectory(const std::string& sourceDirectory,
   }
   return guarded(ENOMEM, [&] {
     return copyOrMove(Mode::copy, sourceDirectory + "/" + name, destinationDirectory + "/" + name, ::getuid(),
-                      ::getgid());
+                      ::getgid(), Durability::onReturn);
   });
 }
 
@@ -356,6 +369,18 @@ bool FileSystemManager::createEmptyFile(const std::string& path) noexcept {
   if (file == nullptr) return false;
   (void)std::fclose(file);  // nothing was written
   return true;
+}
+
+int FileSystemManager::placeLink(const std::string& linkPath, const std::string& target) noexcept {
+  return files().placeLink(linkPath, target).codeOr(kUnexplained);
+}
+
+int FileSystemManager::removeEntry(const std::string& path) noexcept {
+  return files().removeEntry(path).codeOr(kUnexplained);
+}
+
+int FileSystemManager::syncItem(const std::string& path) noexcept {
+  return files().syncItem(path).codeOr(kUnexplained);
 }
 
 }  // namespace brenvik

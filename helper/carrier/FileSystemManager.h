@@ -50,6 +50,9 @@ class FileSystemManager final : public FileSystemInterface {
   int createSymbolicLink(const std::string& linkPath, const std::string& target) noexcept override;
   bool isDirectory(const std::string& path) noexcept override;
   bool createEmptyFile(const std::string& path) noexcept override;
+  int placeLink(const std::string& linkPath, const std::string& target) noexcept override;
+  int removeEntry(const std::string& path) noexcept override;
+  int syncItem(const std::string& path) noexcept override;
 
  private:
   enum class Mode { copy, move };
@@ -70,9 +73,11 @@ class FileSystemManager final : public FileSystemInterface {
 
   FileManager& files() const { return scope_.files(); }
   FileOutcome transfer(Mode mode, const std::string& source, const std::string& destination,
-                       IfPresent ifPresent);
-  int copyOrMove(Mode mode, const std::string& source, const std::string& destination, uid_t uid, gid_t gid);
-  int merge(Mode mode, const std::string& source, const std::string& destination, IfPresent ifPresent);
+                       IfPresent ifPresent, Durability durability);
+  int copyOrMove(Mode mode, const std::string& source, const std::string& destination, uid_t uid, gid_t gid,
+                 Durability durability = Durability::eventual);
+  int merge(Mode mode, const std::string& source, const std::string& destination, IfPresent ifPresent,
+            Durability durability);
   int setAttributesBelow(const std::string& path, const ItemAttributes& attributes);
 
   const ReleaseScope scope_;

@@ -192,6 +192,26 @@ TEST_F(FileSystemManagerTest, ADirectoryCopiedOntoItselfEndsAndKeepsItsFiles) {
   EXPECT_FALSE(isThere(dir / "tree/tree/tree"));
 }
 
+TEST_F(FileSystemManagerTest, ADirectoryCopiedIntoADirectoryBelowItIsNotCopiedOnAndOn) {
+  dir.file("home/Library/Preferences/file", "x");
+  dir.file("home/Library/Logs/other", "o");
+  const std::string reports = dir.directory("home/Library/Logs/Reports");
+  dir.file("home/Library/Logs/Reports/report", "r");
+  const auto items = [&](const std::string& path) {
+    return std::distance(std::filesystem::recursive_directory_iterator(path), {});
+  };
+  const auto before = items(dir / "home/Library");
+  for (int round = 0; round < 3; ++round) {
+    EXPECT_EQ(manager.copyItem(dir / "home/Library", reports), 0);
+    EXPECT_EQ(contentOf(reports + "/Library/Preferences/file"), "x");
+    EXPECT_EQ(contentOf(reports + "/Library/Logs/other"), "o");
+    EXPECT_EQ(contentOf(reports + "/Library/Logs/Reports/report"), "r");
+    EXPECT_FALSE(isThere(reports + "/Library/Logs/Reports/Library"));
+    // Each item once more, and the copy's own top.
+    EXPECT_EQ(items(dir / "home/Library"), 2 * before + 1) << round;
+  }
+}
+
 TEST_F(FileSystemManagerTest, TheSourceItselfIsGivenToTheOwnerBeforeItIsMoved) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs root to give files away";
   const std::string file = dir.file("file", "x");

@@ -52,9 +52,11 @@ void MobileUser::fill() {
   static_assert(kName.size() < buffer.size());  // so that nothing is allocated for it
   std::size_t size = buffer.size();
   const char* const name = GetOrCreateCString(allocator_, kName, buffer.data(), &size, StringEncoding::utf8);
-  const auto path = accounts_.homeDirectoryOf(name);
+  auto path = accounts_.homeDirectoryOf(name);
   const auto ids = accounts_.idsOf(name);
   if (path) {
+    // Paths are built as home + "/Library/..." and compared as text.
+    while (path->size() > 1 && path->back() == '/') path->pop_back();
     homeDirectory_ = GetOrCreateCString(allocator_, *path, nullptr, nullptr, StringEncoding::utf8);
     if (homeDirectory_ == nullptr) throw std::bad_alloc();
   }

@@ -24,8 +24,8 @@ class MobileUser {
   MobileUser& operator=(const MobileUser&) = delete;
   ~MobileUser();
 
-  // The path of its home directory, or null when there is none: to be treated as absent. Lives as long as
-  // this object.
+  // The path of its home directory, without a trailing slash (but for "/"), or null when there is none: to be
+  // treated as absent. Lives as long as this object.
   const char* homeDirectory();
   // 0 when there is no such account.
   uid_t uid();

@@ -4,7 +4,9 @@
 
 #include <gtest/gtest.h>
 
+#include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "platform/accounts/fakes/FakeAccountDirectory.h"
@@ -26,6 +28,17 @@ TEST(MobileUserTest, GivesHomeDirectoryAndIdsOfTheMobileAccount) {
   EXPECT_STREQ(user.homeDirectory(), "/var/mobile");
   EXPECT_EQ(user.uid(), 501U);
   EXPECT_EQ(user.gid(), 502U);
+}
+
+TEST(MobileUserTest, ATrailingSlashOfTheHomeDirectoryIsLeftOut) {
+  const std::vector<std::pair<std::string, std::string>> homes{
+      {"/var/mobile/", "/var/mobile"}, {"/var/mobile//", "/var/mobile"}, {"/", "/"}, {"//", "/"}};
+  for (const auto& [inDatabase, expected] : homes) {
+    FakeAccountDirectory accounts;
+    accounts.accounts["mobile"] = {AccountIds{501, 502}, inDatabase};
+    MobileUser user(accounts);
+    EXPECT_EQ(user.homeDirectory(), expected) << inDatabase;
+  }
 }
 
 TEST(MobileUserTest, WithoutAMobileEntryUidAndGidAreZeroAndThereIsNoHome) {

@@ -38,7 +38,7 @@ class ArchiveCopier {
   // "copyExtendedAttributes", "copyResources" (resource data, which Linux keeps as "._name" beside its file).
   // 0 when everything was unpacked that no handler skipped, else an errno value. The destination and the
   // directories above it are made when missing. Nothing shows at the destination before the archive was read
-  // to its end; a file that was there then gives way in one step.
+  // to its end; a file that was there then gives way in one step. On the disk when it succeeds.
   virtual int copy(const std::string& archive, const std::string& destination,
                    const PropertyList& options) noexcept = 0;
 };

@@ -36,6 +36,11 @@ enum class IfPresent {
 
 enum class Intermediates { mustExist, create };
 
+enum class Durability {
+  eventual,  // the system writes it to the disk when it sees fit
+  onReturn   // a success is told when everything is on the disk, the names included
+};
+
 struct DirectoryAttributes {
   mode_t mode = 0755;          // exactly this, whatever the umask
   std::string_view ownerName;  // account names; empty: as the system gives
@@ -63,8 +68,8 @@ class ItemVisitor {
 // is itself the item is copied, moved or removed as a link, and nothing is ever written through one.
 //
 // A copy or a move shows at its destination whole or not at all, even when the process is killed. What a
-// killed copy leaves is a hidden ".brenvik-" item beside the destination; the next copy to the same
-// destination clears it away.
+// killed process leaves is a hidden ".brenvik-" item beside the destination; the next operation in that
+// folder removes it. Items of such names that somebody else has made are left alone.
 //
 // One thread at a time. Blocks on the disk and nothing else. Throws nothing: memory exhaustion is ENOMEM.
 class FileManager {
@@ -79,15 +84,27 @@ class FileManager {
   virtual bool itemExists(const std::string& path, bool* isDirectory) noexcept = 0;
 
   // Fail with EINVAL when a directory would come to stand inside itself. moveItem is one rename inside a file
-  // system; across two it copies, then removes the source.
-  virtual FileOutcome copyItem(const std::string& source, const std::string& destination,
-                               IfPresent ifPresent) noexcept = 0;
-  virtual FileOutcome moveItem(const std::string& source, const std::string& destination,
-                               IfPresent ifPresent) noexcept = 0;
+  // system; across two it copies, waits until the copy is on the disk, then removes the source. It ends with
+  // the item whole at one of the two places: where something in the source cannot be removed (EBUSY: a mount;
+  // EPERM: an immutable file; EROFS ...), it stays where it was. A source that ends in "." or ".." is EBUSY.
+  virtual FileOutcome copyItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
+                               Durability durability = Durability::eventual) noexcept = 0;
+  virtual FileOutcome moveItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
+                               Durability durability = Durability::eventual) noexcept = 0;
   // With everything below it.
   virtual FileOutcome removeItem(const std::string& path) noexcept = 0;
+  // A file, a link or an empty directory; on the disk when it succeeds.
+  virtual FileOutcome removeEntry(const std::string& path) noexcept = 0;
 
-  // With `create`, a directory that is there already is a success, and the attributes go to those made.
+  // A symbolic link at the path, on the disk when it succeeds. What stands there gives way in one step, a
+  // directory only if it is empty. When the link cannot be made, what was there stays.
+  virtual FileOutcome placeLink(const std::string& path, const std::string& target) noexcept = 0;
+
+  // Waits until the item, its attributes, everything below it and its name are on the disk.
+  virtual FileOutcome syncItem(const std::string& path) noexcept = 0;
+
+  // With `create`, a directory that is there already is a success, and the attributes go to those made. What
+  // is made is on the disk when it succeeds.
   virtual FileOutcome createDirectory(const std::string& path, const DirectoryAttributes& attributes,
                                       Intermediates intermediates) noexcept = 0;
 

@@ -4,10 +4,13 @@
 import os
 import pathlib
 import plistlib
+import re
 import shutil
 import sqlite3
+import unittest
 import zipfile
 
+import tracing
 import wire
 from harness import ERROR, INFO, LOG_ERR, LOG_NOTICE, SANITIZED, HelperTest, main
 
@@ -83,6 +86,24 @@ class Bundles(CarrierTest):
         self.assertEqual(os.readlink(link), "target")
         self.logs.wait_for("unified", INFO, f"{link} is within allowed path {link}")
 
+    def test_a_file_over_which_nothing_can_be_copied_is_no_success(self):
+        BUNDLES.mkdir()
+        (BUNDLES / "null").write_text("old")
+        self.assertEqual(self.copy("/dev", BUNDLES, "null"), 0)
+        self.assertEqual((BUNDLES / "null").read_text(), "old")
+
+    def test_crash_logs_of_a_folder_above_their_own_are_copied_once(self):
+        reporter = LIBRARY / "Logs" / "CrashReporter"
+        reporter.mkdir(parents=True)
+        (reporter / "report").write_text("r")
+        for number in range(10):
+            (LIBRARY / "Preferences").mkdir(exist_ok=True)
+            (LIBRARY / "Preferences" / f"{number}.plist").write_text("x")
+        before = len(list(LIBRARY.rglob("*")))
+        self.assertEqual(self.caller.integer("CopyCrashLogs", short(LIBRARY)), 1)
+        self.assertEqual((reporter / "Library" / "Preferences" / "7.plist").read_text(), "x")
+        self.assertEqual(len(list(LIBRARY.rglob("*"))), 2 * before + 1)
+
     def test_a_link_where_a_directory_stands_gets_8_and_its_line(self):
         link = LIBRARY / "Carrier Bundle.bundle"
         link.mkdir()
@@ -143,6 +164,89 @@ class Bundles(CarrierTest):
         self.assertEqual(os.readlink(WORK / "link"), "a" * 1023)
 
 
+CALLS = ["write", "pwrite64", "fsync", "syncfs", "linkat", "rename", "renameat", "renameat2", "symlinkat", "mkdirat",
+         "fchmod", "lchown", "fchownat", "unlink", "unlinkat", "sendto", "sendmsg", "epoll_wait"]
+
+
+@unittest.skipIf(SANITIZED, "the leak checker cannot be traced")
+class Durability(CarrierTest):
+    """What was answered is on the disk: the order of the daemon's system calls."""
+
+    def calls(self, work):
+        """(name, arguments) of the calls of one request, up to its answer; descriptors with their paths."""
+        text = tracing.traced(self, self.daemon.pid, work, "-y", "-e", "trace=" + ",".join(CALLS))
+        found = re.findall(r"^\d+ +(\w+)\((.*)\) += 0", text[:text.rindex("sendto(")], re.M)
+        self.assertTrue(found, text)
+        return found
+
+    def assert_order(self, calls, *wanted):
+        """The calls named come in this order, with others between; a call is a name and what its arguments hold."""
+        rest = list(calls)
+        for name, *parts in wanted:
+            at = next((i for i, (call, arguments) in enumerate(rest)
+                       if re.fullmatch(name, call) and all(part in arguments for part in parts)), None)
+            self.assertIsNotNone(at, f"{name} {parts} not in {rest} of {calls}")
+            del rest[:at + 1]
+
+    def test_a_copied_file_and_its_folder(self):
+        (WORK / "carrier.plist").write_text("content")
+        BUNDLES.mkdir()
+        for old in (False, True):
+            calls = self.calls(lambda: self.assertEqual(self.copy(WORK, BUNDLES, "carrier.plist"), 1))
+            shown = ("renameat", '"carrier.plist"') if old else ("linkat", '"carrier.plist"')
+            self.assert_order(calls, ("fsync", "#"), shown, ("fsync", f"{BUNDLES}>"), ("lchown", "carrier.plist"),
+                              ("fsync", "carrier.plist"), ("fsync", f"{BUNDLES}>"))
+
+    def test_the_folders_that_are_made_on_the_way(self):
+        (WORK / "carrier.plist").write_text("content")
+        calls = self.calls(lambda: self.assertEqual(self.copy(WORK, BUNDLES / "A", "carrier.plist"), 1))
+        self.assert_order(calls, ("renameat2", '"Carrier Bundles"'), ("fsync", f"{LIBRARY}>"),
+                          ("renameat2", '"A"'), ("fsync", f"{BUNDLES}>"), ("linkat", "carrier.plist"))
+
+    def test_an_unpacked_archive(self):
+        archive = self.zip([("Small.bundle/carrier.plist", b"content")])
+        for there in (False, True):
+            calls = self.calls(lambda: self.assertEqual(self.unpack(archive, WORK / "out"), 1))
+            if there:
+                self.assert_order(calls, ("syncfs", "/new"), ("renameat2?", "carrier.plist"),
+                                  ("syncfs", f"{WORK}/out>"))
+            else:
+                self.assert_order(calls, ("syncfs", "/new"), ("renameat2", '"out"'), ("fsync", f"{WORK}>"))
+
+    def test_links(self):
+        link = LIBRARY / "Carrier Bundle.bundle"
+        calls = self.calls(lambda: self.assertEqual(self.link("first", link), 0))
+        self.assert_order(calls, ("symlinkat", '"Carrier Bundle.bundle"'), ("fsync", f"{LIBRARY}>"))
+        calls = self.calls(lambda: self.assertEqual(self.link("second", link), 0))
+        self.assert_order(calls, ("symlinkat", ".brenvik-"), ("renameat", '"Carrier Bundle.bundle"'),
+                          ("fsync", f"{LIBRARY}>"))
+        created = lambda: self.assertEqual(self.caller.status("CreateSymlink", long("t"), long(WORK / "link")), 0)
+        self.assert_order(self.calls(created), ("symlinkat", '"link"'), ("fsync", f"{WORK}>"))
+        removed = lambda: self.assertEqual(self.caller.status("RemoveCarrierFile", long(link), long("")), 0)
+        self.assert_order(self.calls(removed), ("unlink", "Carrier Bundle"), ("fsync", f"{LIBRARY}>"))
+
+    def test_a_move_inside_a_file_system(self):
+        (WORK / "bundle").mkdir()
+        BUNDLES.mkdir()
+        inside = BUNDLES / "from"
+        (inside / "bundle").mkdir(parents=True)
+        calls = self.calls(lambda: self.assertEqual(self.move(inside / "bundle", BUNDLES, "moved"), 1))
+        self.assert_order(calls, ("renameat2", '"moved"'), ("fsync", f"{BUNDLES}>"), ("fsync", f"{inside}>"))
+
+    def test_a_move_to_another_file_system_removes_nothing_before_the_copy_is_on_the_disk(self):
+        self.assertNotEqual(WORK.stat().st_dev, LIBRARY.stat().st_dev)
+        (WORK / "bundle").mkdir()
+        (WORK / "bundle" / "file").write_text("content")
+        BUNDLES.mkdir()
+        calls = self.calls(lambda: self.assertEqual(self.move(WORK / "bundle", BUNDLES, "moved"), 1))
+        self.assert_order(calls, ("syncfs", "/new"), ("renameat2", '"moved"'), ("fsync", f"{BUNDLES}>"),
+                          ("renameat", '"bundle"'), ("fsync", f"{WORK}>"), ("unlinkat", '"file"'))
+        names = [name for name, _ in calls]
+        self.assertLess(names.index("syncfs"), names.index("unlinkat"))
+        self.assertEqual((BUNDLES / "moved" / "file").read_text(), "content")
+        self.assertEqual(os.listdir(WORK), [])
+
+
 class Archives(CarrierTest):
     def test_hostile_archives_are_refused_and_the_helper_goes_on(self):
         pid = self.daemon.pid
@@ -169,6 +273,15 @@ class Archives(CarrierTest):
         self.assertEqual(self.unpack(path, WORK / "out"), 0)
         self.logs.wait_for("bsd", LOG_ERR, "ArkCopier signaled fatal file error")
         self.assertFalse((WORK / "out").exists())
+
+    def test_what_is_private_in_the_archive_is_private_on_the_disk(self):
+        private = zipfile.ZipInfo("private")
+        private.create_system, private.external_attr = 3, 0o100600 << 16
+        shared = zipfile.ZipInfo("shared")
+        shared.create_system, shared.external_attr = 3, 0o100644 << 16
+        self.assertEqual(self.unpack(self.zip([(private, "x"), (shared, "x")]), WORK / "out"), 1)
+        self.assertEqual((WORK / "out" / "private").stat().st_mode, 0o100600)
+        self.assertEqual((WORK / "out" / "shared").stat().st_mode, 0o100644)
 
     def test_a_bomb_ends_at_the_cap_and_the_helper_stays_small(self):
         path = WORK / "bomb.zip"

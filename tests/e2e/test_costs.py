@@ -1,16 +1,15 @@
 # SPDX-License-Identifier: Apache-2.0
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 """What a request costs the real process: system calls and memory from the heap."""
-import pathlib
 import re
 import signal
 import struct
-import subprocess
 import unittest
 
 import allocations
+import tracing
 import wire
-from harness import Daemon, HelperTest, eventually, main
+from harness import Daemon, HelperTest, main
 
 CALLS = 50
 
@@ -36,18 +35,10 @@ class Costs(HelperTest):
 
     def calls_traced(self, work):
         """The system calls of the process while work() runs, from one wait to the next."""
-        output = pathlib.Path("/tmp/trace")
-        tracer = subprocess.Popen(["strace", "-f", "-p", str(self.daemon.pid), "-o", str(output)],
-                                  stderr=subprocess.PIPE)
-        self.assertIn(b"attached", tracer.stderr.readline())
-        work()
-        # The reply is seen before the tracer has written what comes after it.
-        eventually(lambda: re.search(rb"epoll_wait\([^\n]*\Z", output.read_bytes().rstrip()), what="the next wait")
-        tracer.send_signal(signal.SIGINT)
-        tracer.communicate(timeout=10)
+        text = tracing.traced(self, self.daemon.pid, work)
         # Without waits that a signal broke off, as when the machine's processes are stopped for a while, and without
         # looks at the clock, which some machines make system calls of.
-        return [name for name, rest in re.findall(r"^\d+ +(\w+)\((.*)", output.read_text(), re.M)
+        return [name for name, rest in re.findall(r"^\d+ +(\w+)\((.*)", text, re.M)
                 if "EINTR" not in rest and name != "clock_gettime"]
 
     def test_an_in_line_request_costs_three_system_calls(self):

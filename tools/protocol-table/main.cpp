@@ -162,7 +162,8 @@ std::vector<Description> descriptions() {
        sizeof(TwoStrings256Request),
        {TEXT(TwoStrings256Request, first, "archive path"),
         TEXT(TwoStrings256Request, second, "destination path")},
-       "Unpacks a zip archive into a folder; tells whether that succeeded.",
+       "Unpacks a zip archive into a folder, each entry with its permission bits but none that is set-id or "
+       "sticky; tells whether that succeeded.",
        ""},
       {"LoadPlistFile",
        sizeof(String256Request),

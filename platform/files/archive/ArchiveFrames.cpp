@@ -74,12 +74,12 @@ int ArchiveFrameParser::takeEntry() {
   std::memcpy(&head, pending_.data(), sizeof head);
   if (sizeof head + head.pathLength + head.targetLength != pending_.size() ||
       head.pathLength > archive_frame::kLongestPath || head.targetLength > archive_frame::kLongestPath ||
-      head.kind > Kind::link || (head.kind != Kind::link && head.targetLength != 0)) {
+      head.kind > Kind::link || head.mode > 0777 || (head.kind != Kind::link && head.targetLength != 0)) {
     return EPROTO;
   }
   ArchiveEntry entry;
   entry.kind = head.kind;
-  entry.isExecutable = head.isExecutable != 0;
+  entry.mode = head.mode;
   entry.size = head.size;
   entry.modified = head.modified;
   entry.path = pending_.substr(sizeof head, head.pathLength);

@@ -38,8 +38,8 @@ struct EntryHead {
   std::uint16_t pathLength;
   std::uint16_t targetLength;
   Kind kind;
-  std::uint8_t isExecutable;
-  std::uint8_t pad[2];
+  std::uint8_t pad;
+  std::uint16_t mode;  // permission bits only
 };
 static_assert(sizeof(EntryHead) == 24);
 
@@ -58,7 +58,7 @@ inline constexpr std::uint32_t kLargestCompanion = 4 << 20;  // as much as the r
 
 struct ArchiveEntry {
   archive_frame::Kind kind = archive_frame::Kind::file;
-  bool isExecutable = false;
+  std::uint16_t mode = 0644;  // permission bits; no set-id, no sticky bit. Means nothing for a link
   std::uint64_t size = archive_frame::kUnknownSize;
   std::int64_t modified = archive_frame::kNoTime;
   std::string path;    // as the archive has it, not checked

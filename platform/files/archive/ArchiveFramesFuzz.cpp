@@ -37,7 +37,7 @@ class CheckingSink final : public ArchiveFrameSink {
   int beginEntry(const ArchiveEntry& entry) override {
     require(!open_);
     open_ = true;
-    require(entry.path.size() <= archive_frame::kLongestPath);
+    require(entry.path.size() <= archive_frame::kLongestPath && entry.mode <= 0777);
     if (!isCleanEntryPath(entry.path)) return 0;
     require(entry.path.front() != '/' && entry.path.find("//") == std::string::npos);
     require(("/" + entry.path + "/").find("/../") == std::string::npos);

@@ -24,6 +24,11 @@ class FaultyFileManager final : public FileManager {
     partOf_[operation] = part;
     fail(operation, outcome);
   }
+  // From now on the operation is the real one again.
+  void recover(const std::string& operation) {
+    faults_.erase(operation);
+    partOf_.erase(operation);
+  }
 
   std::vector<std::string> calls;  // "operation path [path]"
   int openScopes = 0;
@@ -41,17 +46,29 @@ class FaultyFileManager final : public FileManager {
   bool itemExists(const std::string& path, bool* isDirectory) noexcept override {
     return real_.itemExists(path, isDirectory);
   }
-  FileOutcome copyItem(const std::string& source, const std::string& destination,
-                       IfPresent ifPresent) noexcept override {
+  FileOutcome copyItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
+                       Durability durability) noexcept override {
     calls.push_back("copyItem " + source + " " + destination);
     if (const FileOutcome* fault = faultOf("copyItem", destination)) return *fault;
-    return real_.copyItem(source, destination, ifPresent);
+    return real_.copyItem(source, destination, ifPresent, durability);
   }
-  FileOutcome moveItem(const std::string& source, const std::string& destination,
-                       IfPresent ifPresent) noexcept override {
+  FileOutcome moveItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
+                       Durability durability) noexcept override {
     calls.push_back("moveItem " + source + " " + destination);
     if (const FileOutcome* fault = faultOf("moveItem", destination)) return *fault;
-    return real_.moveItem(source, destination, ifPresent);
+    return real_.moveItem(source, destination, ifPresent, durability);
+  }
+  FileOutcome removeEntry(const std::string& path) noexcept override {
+    if (const FileOutcome* fault = faultOf("removeEntry", path)) return *fault;
+    return real_.removeEntry(path);
+  }
+  FileOutcome placeLink(const std::string& path, const std::string& target) noexcept override {
+    if (const FileOutcome* fault = faultOf("placeLink", path)) return *fault;
+    return real_.placeLink(path, target);
+  }
+  FileOutcome syncItem(const std::string& path) noexcept override {
+    if (const FileOutcome* fault = faultOf("syncItem", path)) return *fault;
+    return real_.syncItem(path);
   }
   FileOutcome removeItem(const std::string& path) noexcept override {
     calls.push_back("removeItem " + path);

@@ -86,13 +86,13 @@ int FileContents::copyMapped(int source, int destination, off_t* offset, off_t e
   return 0;
 }
 
-int FileContents::copyRange(int source, int destination, off_t offset, off_t length) {
-  const off_t end = offset + length;
-  while (tryCopyRange_ && length > kSmallFile && offset < end) {
-    off_t from = offset;
-    off_t to = offset;
+// *offset: how far it came, which is less than `end` where the source is shorter. 0 or errno.
+int FileContents::copyRange(int source, int destination, off_t* offset, off_t end) {
+  while (tryCopyRange_ && end - *offset > kSmallFile) {
+    off_t from = *offset;
+    off_t to = *offset;
     const ssize_t copied =
-        ::copy_file_range(source, &from, destination, &to, static_cast<std::size_t>(end - offset), 0);
+        ::copy_file_range(source, &from, destination, &to, static_cast<std::size_t>(end - *offset), 0);
     if (copied == 0) break;  // the file ends here, or a file system that cannot do it says so this way
     if (copied < 0) {
       if (errno == EINTR) continue;
@@ -100,27 +100,43 @@ int FileContents::copyRange(int source, int destination, off_t offset, off_t len
       tryCopyRange_ = false;
       break;
     }
-    offset += copied;
+    *offset += copied;
   }
   char* const bytes = buffer();
-  while (offset < end) {
-    const auto want = static_cast<std::size_t>(std::min<off_t>(end - offset, kBufferSize));
-    const ssize_t got = ::pread(source, bytes, want, offset);
+  while (*offset < end) {
+    const auto want = static_cast<std::size_t>(std::min<off_t>(end - *offset, kBufferSize));
+    const ssize_t got = ::pread(source, bytes, want, *offset);
     if (got < 0 && errno == EINTR) continue;
     if (got < 0) return errno;
-    if (got == 0) return 0;  // shortened meanwhile
+    if (got == 0) return 0;
+    if (const int error = writeAll(destination, bytes, static_cast<std::size_t>(got), *offset); error != 0) {
+      return error;
+    }
+    *offset += got;
+  }
+  return 0;
+}
+
+// From `offset` to the source's end, wherever that is. 0 or errno.
+int FileContents::copyRest(int source, int destination, off_t offset) {
+  char* const bytes = buffer();
+  for (;;) {
+    const ssize_t got = ::pread(source, bytes, kBufferSize, offset);
+    if (got < 0 && errno == EINTR) continue;
+    if (got <= 0) return got == 0 ? 0 : errno;
     if (const int error = writeAll(destination, bytes, static_cast<std::size_t>(got), offset); error != 0) {
       return error;
     }
     offset += got;
   }
-  return 0;
 }
 
 int FileContents::copyData(int source, const struct stat& info, int destination) {
-  if (info.st_size == 0) return 0;
+  // A file without blocks may have content that is made when it is read.
+  if (info.st_size == 0) return copyRest(source, destination, 0);
   const bool sparse = info.st_blocks * 512 < info.st_size;
-  if (info.st_size <= kSmallFile && !sparse) return copyRange(source, destination, 0, info.st_size);
+  off_t done = 0;
+  if (info.st_size <= kSmallFile && !sparse) return copyRange(source, destination, &done, info.st_size);
   if (tryClone_) {
     if (::ioctl(destination, FICLONE, source) == 0) return 0;
     if (!meansUnsupported(errno)) return errno;
@@ -135,23 +151,23 @@ int FileContents::copyData(int source, const struct stat& info, int destination)
         (errno == ENOSPC || errno == EDQUOT || errno == EFBIG)) {
       return errno;
     }
-    off_t done = 0;
     // Where both ends are in this machine's memory; elsewhere the file system may do it alone.
     if (isLarge && (system.f_type == EXT4_SUPER_MAGIC || system.f_type == F2FS_SUPER_MAGIC ||
                     system.f_type == TMPFS_MAGIC)) {
       if (const int error = copyMapped(source, destination, &done, info.st_size); error != 0) return error;
     }
-    return copyRange(source, destination, done, info.st_size - done);
+    return copyRange(source, destination, &done, info.st_size);
   }
   for (off_t at = 0; at < info.st_size;) {
     const off_t data = ::lseek(source, at, SEEK_DATA);
     if (data < 0 && errno == ENXIO) break;  // a hole to the end
-    if (data < 0) return errno == EINVAL ? copyRange(source, destination, at, info.st_size - at) : errno;
+    if (data < 0) return errno == EINVAL ? copyRange(source, destination, &at, info.st_size) : errno;
     const off_t hole = ::lseek(source, data, SEEK_HOLE);
     if (hole < 0) return errno;
     const off_t end = std::min(hole, info.st_size);
-    if (const int error = copyRange(source, destination, data, end - data); error != 0) return error;
-    at = end;
+    at = data;
+    if (const int error = copyRange(source, destination, &at, end); error != 0) return error;
+    if (at < end) return 0;  // shorter than it said: no zeros take the place of what is not there
   }
   return ::ftruncate(destination, info.st_size) == 0 ? 0 : errno;
 }

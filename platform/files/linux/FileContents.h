@@ -18,7 +18,8 @@ int writeAll(int file, std::string_view bytes) noexcept;
 class FileContents {
  public:
   // Copies the data of `source` into the empty file `destination`, both at their start; shared blocks where
-  // the file system can, holes stay holes. `info`: of the source. 0 or errno. May throw std::bad_alloc.
+  // the file system can, holes stay holes. `info`: of the source; a file may have more or less than it says,
+  // as those of /proc and /sys do. 0 or errno. May throw std::bad_alloc.
   int copyData(int source, const struct stat& info, int destination);
 
   enum class Owner { asCreated, asSource };
@@ -33,7 +34,8 @@ class FileContents {
  private:
   char* buffer();
   int copyMapped(int source, int destination, off_t* offset, off_t end);
-  int copyRange(int source, int destination, off_t offset, off_t length);
+  int copyRange(int source, int destination, off_t* offset, off_t end);
+  int copyRest(int source, int destination, off_t offset);
   int copyExtendedAttributes(int source, int destination);
 
   struct Free {

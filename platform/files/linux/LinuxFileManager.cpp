@@ -14,6 +14,7 @@
 #include <new>
 
 #include "platform/files/linux/DirectoryNames.h"
+#include "platform/files/linux/Durability.h"
 #include "platform/files/linux/FileContents.h"
 #include "platform/files/linux/HeldDirectory.h"
 #include "platform/files/linux/Placement.h"
@@ -81,17 +82,47 @@ int idOfGroup(std::string_view name, gid_t* gid) {
   return 0;
 }
 
-struct ResolvedAttributes {
+bool isDirectory(const std::string& path) {
+  struct stat info {};
+  return ::stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode);
+}
+
+}  // namespace
+
+struct LinuxFileManager::ResolvedAttributes {
   mode_t mode;
   uid_t uid = static_cast<uid_t>(-1);
   gid_t gid = static_cast<gid_t>(-1);
 };
 
+void LinuxFileManager::closeScope() noexcept {
+  if (--scopes_ != 0) return;
+  contents_.reset();
+  cleared_.clear();
+}
+
+void LinuxFileManager::removeLeftoversOnce(const Place& place) {
+  if (scopes_ > 0) {
+    // Once for each folder of a request: a merge comes to the same one for every file.
+    struct stat info {};
+    if (::fstat(place.directory.get(), &info) != 0) return;
+    if (!cleared_.emplace(info.st_dev, info.st_ino).second) return;
+  }
+  removeLeftovers(place.directory.get());
+}
+
+// 0 or errno, as Place::open().
+int LinuxFileManager::openPlace(const std::string& path, Place* place) {
+  if (const int error = Place::open(path, place); error != 0) return error;
+  removeLeftoversOnce(*place);
+  return 0;
+}
+
 // Makes one directory with exactly these attributes. It shows under its name only with them: a directory in
 // the making would be taken for the finished one by the next call.
-int makeDirectory(const std::string& path, const ResolvedAttributes& attributes) {
+int LinuxFileManager::makeDirectory(const std::string& path, const ResolvedAttributes& attributes) {
   Place place;
-  if (const int error = Place::open(path, &place); error != 0) return error;
+  if (const int error = openPlace(path, &place); error != 0) return error;
   struct stat there {};
   if (::fstatat(place.directory.get(), place.name.c_str(), &there, AT_SYMLINK_NOFOLLOW) == 0) return EEXIST;
   Stage stage(place);
@@ -99,15 +130,11 @@ int makeDirectory(const std::string& path, const ResolvedAttributes& attributes)
   const bool giveAway = attributes.uid != static_cast<uid_t>(-1) || attributes.gid != static_cast<gid_t>(-1);
   if (giveAway && ::fchown(stage.get(), attributes.uid, attributes.gid) != 0) return errno;
   if (::fchmod(stage.get(), attributes.mode & 07777) != 0) return errno;
-  return stage.publish(IfPresent::fail);
+  if (const int error = stage.publish(IfPresent::fail); error != 0) return error;
+  return syncNames(place.directory.get());
 }
 
-bool isDirectory(const std::string& path) {
-  struct stat info {};
-  return ::stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode);
-}
-
-int makeDirectories(const std::string& path, const ResolvedAttributes& attributes) {
+int LinuxFileManager::makeDirectories(const std::string& path, const ResolvedAttributes& attributes) {
   const int error = makeDirectory(path, attributes);
   if (error == 0 || isDirectory(path)) return 0;
   struct stat info {};
@@ -124,12 +151,6 @@ int makeDirectories(const std::string& path, const ResolvedAttributes& attribute
   return last == EEXIST && isDirectory(path) ? 0 : last;  // "a/b/" was made by the loop
 }
 
-}  // namespace
-
-void LinuxFileManager::closeScope() noexcept {
-  if (--scopes_ == 0) contents_.reset();
-}
-
 FileContents& LinuxFileManager::contents() {
   if (!contents_ || scopes_ == 0) contents_ = std::make_unique<FileContents>();
   return *contents_;
@@ -142,96 +163,185 @@ bool LinuxFileManager::itemExists(const std::string& path, bool* isDirectory) no
   return exists;
 }
 
-int LinuxFileManager::copy(const std::string& source, const std::string& destination, IfPresent ifPresent) {
+// Makes a copy of the item in the stage, with everything on the disk but its name where that is asked for.
+// *info: of the item; then of what was opened. 0 or errno.
+int LinuxFileManager::stageCopy(int sourceDirectory, const char* source, struct stat* info,
+                                const Place& place, Stage& stage, TreeCopier::Source afterwards,
+                                Durability durability) {
+  TreeCopier copier(contents(), ::geteuid(), ::getegid(), afterwards);
+  const bool isDurable = durability == Durability::onReturn;
+  if (S_ISDIR(info->st_mode)) {
+    const UniqueFd from(::openat(sourceDirectory, source, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (!from.isValid() || ::fstat(from.get(), info) != 0) return errno;
+    if (isInside(place.directory.get(), *info)) return EINVAL;
+    if (const int error = stage.makeDirectory(); error != 0) return error;
+    if (const int error = copier.copyDirectoryInto(from.get(), *info, stage.get()); error != 0) return error;
+    return isDurable ? syncFileSystem(stage.get()) : 0;
+  }
+  if (S_ISREG(info->st_mode)) {
+    const UniqueFd from(
+        ::openat(sourceDirectory, source, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    if (!from.isValid() || ::fstat(from.get(), info) != 0) return errno;
+    if (!S_ISREG(info->st_mode)) return EBUSY;
+    if (const int error = stage.makeFile(); error != 0) return error;
+    if (const int error = copier.copyFileInto(from.get(), *info, stage.get()); error != 0) return error;
+    return isDurable ? syncFile(stage.get()) : 0;
+  }
+  if (const int error = stage.makeRoom(); error != 0) return error;
+  return copier.copySpecial(sourceDirectory, source, *info, stage.room(), Stage::itemName());
+}
+
+int LinuxFileManager::copy(const std::string& source, const std::string& destination, IfPresent ifPresent,
+                           Durability durability) {
   struct stat info {};
   if (::lstat(source.c_str(), &info) != 0) return errno;
   Place place;
-  if (const int error = Place::open(destination, &place); error != 0) return error;
+  if (const int error = openPlace(destination, &place); error != 0) return error;
   struct stat there {};
   const bool present = ::fstatat(place.directory.get(), place.name.c_str(), &there, AT_SYMLINK_NOFOLLOW) == 0;
   if (present && (ifPresent == IfPresent::fail || S_ISDIR(there.st_mode))) return EEXIST;
 
   Stage stage(place);
-  TreeCopier copier(contents(), ::geteuid(), ::getegid());
-  if (S_ISDIR(info.st_mode)) {
-    const UniqueFd from(::open(source.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-    if (!from.isValid() || ::fstat(from.get(), &info) != 0) return errno;
-    if (isInside(place.directory.get(), info)) return EINVAL;
-    if (const int error = stage.makeDirectory(); error != 0) return error;
-    if (const int error = copier.copyDirectoryInto(from.get(), info, stage.get()); error != 0) return error;
-  } else if (S_ISREG(info.st_mode)) {
-    const UniqueFd from(::open(source.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-    if (!from.isValid() || ::fstat(from.get(), &info) != 0) return errno;
-    if (!S_ISREG(info.st_mode)) return EBUSY;
-    if (const int error = stage.makeFile(); error != 0) return error;
-    if (const int error = copier.copyFileInto(from.get(), info, stage.get()); error != 0) return error;
-  } else {
-    if (const int error = stage.reserveName(); error != 0) return error;
-    if (const int error =
-            copier.copySpecial(AT_FDCWD, source.c_str(), info, place.directory.get(), stage.name());
-        error != 0) {
-      return error;
-    }
-    stage.nameIsTaken();
-  }
-  return stage.publish(ifPresent);
+  const int error =
+      stageCopy(AT_FDCWD, source.c_str(), &info, place, stage, TreeCopier::Source::stays, durability);
+  if (error != 0) return error;
+  if (const int failed = stage.publish(ifPresent); failed != 0) return failed;
+  return durability == Durability::onReturn ? syncNames(place.directory.get()) : 0;
 }
 
-int LinuxFileManager::move(const std::string& source, const std::string& destination, IfPresent ifPresent) {
-  if (::renameat2(AT_FDCWD, source.c_str(), AT_FDCWD, destination.c_str(), RENAME_NOREPLACE) == 0) return 0;
-  int error = errno;
+// To another file system. In the end the item is whole at one of the two places, and only there.
+int LinuxFileManager::moveAcross(const Place& from, const Place& to, IfPresent ifPresent) {
+  struct stat info {};
+  struct stat there {};
+  if (::fstatat(from.directory.get(), from.name.c_str(), &info, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+  const bool present = ::fstatat(to.directory.get(), to.name.c_str(), &there, AT_SYMLINK_NOFOLLOW) == 0;
+  if (present && (ifPresent == IfPresent::fail || S_ISDIR(there.st_mode))) return EEXIST;
+
+  // The source goes into a room beside it in one step. Made first: where nothing can be made, nothing can be
+  // removed.
+  Stage away(from);
+  const int noRoom = away.makeRoom();
+  const bool isFull = noRoom == ENOSPC || noRoom == EDQUOT;  // perhaps that is why it is to be moved
+  if (noRoom != 0 && !isFull) return noRoom;
+
+  Stage stage(to, Stage::Undo::possible);
+  if (const int error = stageCopy(from.directory.get(), from.name.c_str(), &info, to, stage,
+                                  TreeCopier::Source::goes, Durability::onReturn);
+      error != 0) {
+    return error;
+  }
+  if (const int error = stage.publish(ifPresent); error != 0) return error;
+  int error = syncNames(to.directory.get());
+  if (error == 0 && isFull) {
+    if (const int failed = removeTree(from.directory.get(), from.name.c_str()); failed != 0) return failed;
+  } else if (error == 0) {
+    error = away.take(info);
+  }
+  if (error == 0) return syncNames(from.directory.get());
+  // The copy goes, and with it the names that wait for the disk. The first failure is the answer.
+  if (stage.takeBack() == 0) (void)syncNames(to.directory.get());
+  return error;
+}
+
+int LinuxFileManager::move(const std::string& source, const std::string& destination, IfPresent ifPresent,
+                           Durability durability) {
+  Place from;
+  Place to;
+  // EEXIST: "." and ".." name no entry that could be taken away.
+  if (const int error = openPlace(source, &from); error != 0) return error == EEXIST ? EBUSY : error;
+  if (const int error = openPlace(destination, &to); error != 0) return error;
+  const int fromDirectory = from.directory.get();
+  const int toDirectory = to.directory.get();
+  const char* const fromName = from.name.c_str();
+  const char* const toName = to.name.c_str();
+  struct stat info {};
+  if (::fstatat(fromDirectory, fromName, &info, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+  if (!S_ISDIR(info.st_mode) && (source.ends_with('/') || destination.ends_with('/'))) return ENOTDIR;
+
+  int error = ::renameat2(fromDirectory, fromName, toDirectory, toName, RENAME_NOREPLACE) == 0 ? 0 : errno;
+  struct stat there {};
   if (error == EINVAL || error == ENOSYS) {
     // A file system without the flag, or a directory into itself, which the plain call refuses as well.
-    struct stat there {};
-    if (::lstat(destination.c_str(), &there) == 0) {
+    if (::fstatat(toDirectory, toName, &there, AT_SYMLINK_NOFOLLOW) == 0) {
       error = EEXIST;
     } else {
-      if (::rename(source.c_str(), destination.c_str()) == 0) return 0;
-      error = errno;
+      error = ::renameat(fromDirectory, fromName, toDirectory, toName) == 0 ? 0 : errno;
     }
   }
   if (error == EEXIST && ifPresent == IfPresent::replaceNonDirectory) {
-    struct stat from {};
-    struct stat there {};
-    if (::lstat(source.c_str(), &from) != 0 || ::lstat(destination.c_str(), &there) != 0) return errno;
+    if (::fstatat(toDirectory, toName, &there, AT_SYMLINK_NOFOLLOW) != 0) return errno;
     if (S_ISDIR(there.st_mode)) return EEXIST;
-    if (isSameItem(from, there)) {
+    if (isSameItem(info, there)) {
       // rename(2) leaves two names of one file alone. They may even be one name.
-      Place a;
-      Place b;
-      if (const int failed = Place::open(source, &a); failed != 0) return failed;
-      if (const int failed = Place::open(destination, &b); failed != 0) return failed;
-      if (::fstat(a.directory.get(), &from) != 0 || ::fstat(b.directory.get(), &there) != 0) return errno;
-      if (a.name == b.name && isSameItem(from, there)) return 0;
-      return ::unlink(source.c_str()) == 0 ? 0 : errno;
-    }
-    if (!S_ISDIR(from.st_mode)) {
-      if (::rename(source.c_str(), destination.c_str()) == 0) return 0;
-      error = errno;
-    } else if (::renameat2(AT_FDCWD, source.c_str(), AT_FDCWD, destination.c_str(), RENAME_EXCHANGE) == 0) {
-      return ::unlink(source.c_str()) == 0 ? 0 : errno;
+      struct stat a {};
+      struct stat b {};
+      if (::fstat(fromDirectory, &a) != 0 || ::fstat(toDirectory, &b) != 0) return errno;
+      if (from.name == to.name && isSameItem(a, b)) return 0;
+      error = ::unlinkat(fromDirectory, fromName, 0) == 0 ? 0 : errno;
+    } else if (!S_ISDIR(info.st_mode)) {
+      error = ::renameat(fromDirectory, fromName, toDirectory, toName) == 0 ? 0 : errno;
+    } else if (::renameat2(fromDirectory, fromName, toDirectory, toName, RENAME_EXCHANGE) == 0) {
+      error = ::unlinkat(fromDirectory, fromName, 0) == 0 ? 0 : errno;
     } else {
       error = errno;
     }
   }
-  if (error != EXDEV) return error;
-  if (const int failed = copy(source, destination, ifPresent); failed != 0) return failed;
-  // The copy stands whole before the first byte of the source goes.
-  return removeTree(AT_FDCWD, source.c_str());
+  if (error == EXDEV) return moveAcross(from, to, ifPresent);
+  if (error != 0 || durability == Durability::eventual) return error;
+  // The new name first: a power cut in between leaves both, and not none.
+  if (const int failed = syncNames(toDirectory); failed != 0) return failed;
+  return syncNames(fromDirectory);
 }
 
 FileOutcome LinuxFileManager::copyItem(const std::string& source, const std::string& destination,
-                                       IfPresent ifPresent) noexcept {
-  return guarded([&] { return copy(source, destination, ifPresent); });
+                                       IfPresent ifPresent, Durability durability) noexcept {
+  return guarded([&] { return copy(source, destination, ifPresent, durability); });
 }
 
 FileOutcome LinuxFileManager::moveItem(const std::string& source, const std::string& destination,
-                                       IfPresent ifPresent) noexcept {
-  return guarded([&] { return move(source, destination, ifPresent); });
+                                       IfPresent ifPresent, Durability durability) noexcept {
+  return guarded([&] { return move(source, destination, ifPresent, durability); });
 }
 
 FileOutcome LinuxFileManager::removeItem(const std::string& path) noexcept {
   return guarded([&] { return removeTree(AT_FDCWD, path.c_str()); });
+}
+
+FileOutcome LinuxFileManager::removeEntry(const std::string& path) noexcept {
+  return guarded([&] {
+    if (std::remove(path.c_str()) != 0) return errno;
+    Place place;
+    // EEXIST: a directory removed as "name/." is none that remove(3) accepts.
+    if (const int error = openPlace(path, &place); error != 0) return error;
+    return syncNames(place.directory.get());
+  });
+}
+
+FileOutcome LinuxFileManager::placeLink(const std::string& path, const std::string& target) noexcept {
+  return guarded([&] {
+    if (path.ends_with('/')) return ENOTDIR;  // no link has such a name
+    Place place;
+    if (const int error = openPlace(path, &place); error != 0) return error;
+    if (const int error = brenvik::placeLink(place, target); error != 0) return error;
+    return syncNames(place.directory.get());
+  });
+}
+
+FileOutcome LinuxFileManager::syncItem(const std::string& path) noexcept {
+  return guarded([&] {
+    struct stat info {};
+    if (::lstat(path.c_str(), &info) != 0) return errno;
+    if (S_ISREG(info.st_mode) || S_ISDIR(info.st_mode)) {
+      const UniqueFd item(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+      if (!item.isValid()) return errno;
+      const int error = S_ISDIR(info.st_mode) ? syncFileSystem(item.get()) : syncFile(item.get());
+      if (error != 0) return error;
+    }
+    Place place;
+    const int error = Place::open(path, &place);
+    if (error == EEXIST) return 0;  // a directory by itself, which the file system's sync has covered
+    return error != 0 ? error : syncNames(place.directory.get());
+  });
 }
 
 FileOutcome LinuxFileManager::createDirectory(const std::string& path, const DirectoryAttributes& attributes,
@@ -362,7 +472,7 @@ std::optional<std::string> LinuxFileManager::readFile(const std::string& path, s
 bool LinuxFileManager::writeFileAtomically(const std::string& path, std::string_view bytes) noexcept {
   return guarded([&] {
            Place place;
-           if (const int error = Place::open(path, &place); error != 0) return error;
+           if (const int error = openPlace(path, &place); error != 0) return error;
            struct stat there {};
            const bool keep =
                ::fstatat(place.directory.get(), place.name.c_str(), &there, AT_SYMLINK_NOFOLLOW) == 0 &&
@@ -375,11 +485,11 @@ bool LinuxFileManager::writeFileAtomically(const std::string& path, std::string_
              mode = there.st_mode & 0777;
              if (::fchown(stage.get(), there.st_uid, there.st_gid) != 0) mode &= 0700;
            }
-           if (::fchmod(stage.get(), mode) != 0 || ::fdatasync(stage.get()) != 0) return errno;
+           if (::fchmod(stage.get(), mode) != 0) return errno;
+           if (const int error = syncFile(stage.get()); error != 0) return error;
            if (const int error = stage.publish(IfPresent::replaceNonDirectory); error != 0) return error;
            // The name is as durable as the bytes only once its directory is.
-           const UniqueFd directory(::openat(place.directory.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-           return directory.isValid() && ::fsync(directory.get()) == 0 ? 0 : errno;
+           return syncNames(place.directory.get());
          })
       .succeeded();
 }

@@ -2,12 +2,18 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <sys/stat.h>
+
 #include <memory>
+#include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "platform/files/FileManager.h"
 #include "platform/files/linux/FileContents.h"
+#include "platform/files/linux/Placement.h"
+#include "platform/files/linux/TreeCopier.h"
 
 namespace brenvik {
 
@@ -18,11 +24,14 @@ class LinuxFileManager final : public FileManager {
   void closeScope() noexcept override;
 
   bool itemExists(const std::string& path, bool* isDirectory) noexcept override;
-  FileOutcome copyItem(const std::string& source, const std::string& destination,
-                       IfPresent ifPresent) noexcept override;
-  FileOutcome moveItem(const std::string& source, const std::string& destination,
-                       IfPresent ifPresent) noexcept override;
+  FileOutcome copyItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
+                       Durability durability = Durability::eventual) noexcept override;
+  FileOutcome moveItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
+                       Durability durability = Durability::eventual) noexcept override;
   FileOutcome removeItem(const std::string& path) noexcept override;
+  FileOutcome removeEntry(const std::string& path) noexcept override;
+  FileOutcome placeLink(const std::string& path, const std::string& target) noexcept override;
+  FileOutcome syncItem(const std::string& path) noexcept override;
   FileOutcome createDirectory(const std::string& path, const DirectoryAttributes& attributes,
                               Intermediates intermediates) noexcept override;
   FileOutcome listDirectory(const std::string& path, std::vector<std::string>* names) noexcept override;
@@ -33,12 +42,25 @@ class LinuxFileManager final : public FileManager {
   bool writeFile(const std::string& path, std::string_view bytes) noexcept override;
 
  private:
-  int copy(const std::string& source, const std::string& destination, IfPresent ifPresent);
-  int move(const std::string& source, const std::string& destination, IfPresent ifPresent);
+  struct ResolvedAttributes;
+
+  int copy(const std::string& source, const std::string& destination, IfPresent ifPresent,
+           Durability durability);
+  int move(const std::string& source, const std::string& destination, IfPresent ifPresent,
+           Durability durability);
+  int moveAcross(const Place& from, const Place& to, IfPresent ifPresent);
+  int stageCopy(int sourceDirectory, const char* source, struct stat* info, const Place& place, Stage& stage,
+                TreeCopier::Source afterwards, Durability durability);
+  int makeDirectory(const std::string& path, const ResolvedAttributes& attributes);
+  int makeDirectories(const std::string& path, const ResolvedAttributes& attributes);
+  int openPlace(const std::string& path, Place* place);
+  void removeLeftoversOnce(const Place& place);
   FileContents& contents();
 
   int scopes_ = 0;
-  std::unique_ptr<FileContents> contents_;  // lives as long as a scope is open
+  // Live as long as a scope is open.
+  std::unique_ptr<FileContents> contents_;
+  std::set<std::pair<dev_t, ino_t>> cleared_;  // folders whose leftovers have been looked for
 };
 
 }  // namespace brenvik

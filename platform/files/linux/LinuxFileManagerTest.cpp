@@ -4,7 +4,9 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/fs.h>
 #include <sys/file.h>
+#include <sys/ioctl.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
@@ -15,9 +17,12 @@
 #include <algorithm>
 #include <cerrno>
 #include <csignal>
+#include <cstdio>
 #include <cstring>
+#include <functional>
 #include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
@@ -339,6 +344,21 @@ TEST_F(LinuxFileManagerTest, LargeAndSparseFilesAreCopiedByteForByte) {
   EXPECT_LT(statOf(dir / "sparse-copy").st_blocks * 512, 2 << 20);
 }
 
+TEST_F(LinuxFileManagerTest, AFileThatSaysItIsEmptyOrLongerIsCopiedToItsEnd) {
+  for (const char* const source :
+       {"/proc/version", "/sys/kernel/mm/transparent_hugepage/enabled", "/proc/sys/kernel/ostype"}) {
+    const std::string content = contentOf(source);
+    if (content == "(none)") continue;
+    const std::string name = std::to_string(names("").size());
+    EXPECT_EQ(files.copyItem(source, dir / name, IfPresent::fail), kSuccess) << source;
+    EXPECT_EQ(contentOf(dir / name), content) << source;
+  }
+  EXPECT_FALSE(names("").empty());
+  dir.file("empty");
+  EXPECT_EQ(copy("empty", "empty-copy"), kSuccess);
+  EXPECT_EQ(contentOf(dir / "empty-copy"), "");
+}
+
 TEST_F(LinuxFileManagerTest, ATreeDeeperThanTheProcessHasDescriptorsIsCopiedListedAndRemoved) {
   constexpr int kDepth = 1500;
   const std::string top = dir.directory("deep");
@@ -427,41 +447,120 @@ TEST_F(LinuxFileManagerTest, ADirectoryCannotComeToStandInsideItself) {
   EXPECT_EQ(copy("tree", "tree-copy"), kSuccess);
 }
 
-TEST_F(LinuxFileManagerTest, WhatAKilledCopyLeftIsClearedByTheNextAndALivingOnesIsNot) {
-  dir.file("tree/file", "x");
-  // The stage's name follows from the destination's: have a copy leave it behind.
-  const std::string stage = [&] {
+// ---- leftovers
+
+class LeftoversTest : public LinuxFileManagerTest {
+ protected:
+  LeftoversTest() { dir.file("tree/file", "x"); }
+
+  // Has a process die in the middle of a copy into the folder; the hidden name of what it left.
+  std::string leaveOne(const std::string& folder) {
+    dir.directory(folder);
     const pid_t child = ::fork();
     if (child == 0) {
       // The first byte written is its end: between staging and publishing.
       const rlimit none{0, 0};
       ::setrlimit(RLIMIT_CORE, &none);
       ::setrlimit(RLIMIT_FSIZE, &none);
-      (void)copy("tree", "copy");
+      (void)copy("tree", folder + "/copy");
       ::_exit(0);
     }
     int status = 0;
     ::waitpid(child, &status, 0);
     EXPECT_TRUE(WIFSIGNALED(status));
+    EXPECT_FALSE(isThere(dir / (folder + "/copy")));
     std::string left;
-    for (const std::string& name : names("")) {
+    for (const std::string& name : names(folder)) {
       if (name.starts_with(".brenvik-")) left = name;
     }
+    EXPECT_FALSE(left.empty());
     return left;
-  }();
-  ASSERT_FALSE(stage.empty());
-  EXPECT_FALSE(isThere(dir / "copy"));
-  EXPECT_EQ(copy("tree", "copy"), kSuccess);
-  EXPECT_EQ(names(""), (std::vector<std::string>{"copy", "tree"}));
+  }
+};
 
-  // The same name, held by somebody who lives.
-  EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
-  dir.file(stage + "/theirs", "kept");
-  const UniqueFd held(::open((dir / stage).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+TEST_F(LeftoversTest, AnyOperationInTheFolderRemovesThemWhateverItsName) {
+  const std::string file = dir.file("file", "x");
+  const std::string folder = dir.directory("to");
+  const std::vector<std::pair<const char*, std::function<FileOutcome()>>> operations{
+      {"copy", [&] { return copy("file", "to/other"); }},
+      {"replacing copy", [&] { return copy("file", "to/other", IfPresent::replaceNonDirectory); }},
+      {"move into", [&] { return move("file", "to/moved"); }},
+      {"move out of", [&] { return move("to/moved", "file"); }},
+      {"directory", [&] { return files.createDirectory(folder + "/made", {}, Intermediates::mustExist); }},
+      {"link", [&] { return files.placeLink(folder + "/link", "target"); }},
+      {"write",
+       [&] { return files.writeFileAtomically(folder + "/written", "x") ? kSuccess : failure(EIO); }},
+      {"remove", [&] { return files.removeEntry(folder + "/link"); }}};
+  for (const auto& [what, operation] : operations) {
+    const std::string left = leaveOne("to");
+    EXPECT_EQ(operation(), kSuccess) << what;
+    EXPECT_FALSE(isThere(folder + "/" + left)) << what;
+  }
+  EXPECT_EQ(names("to"), (std::vector<std::string>{"made", "other", "written"}));
+}
+
+TEST_F(LeftoversTest, InARequestAFolderIsLookedThroughOnce) {
+  files.openScope();
+  EXPECT_EQ(copy("tree/file", "to-be"), kSuccess);
+  const std::string left = leaveOne(".");
+  EXPECT_EQ(copy("tree/file", "second"), kSuccess);
+  EXPECT_TRUE(isThere(dir / left));
+  files.closeScope();
+  files.openScope();
+  EXPECT_EQ(copy("tree/file", "third"), kSuccess);
+  EXPECT_FALSE(isThere(dir / left));
+  files.closeScope();
+}
+
+TEST_F(LeftoversTest, WhatALivingProcessWorksAtIsNotTouched) {
+  const std::string left = leaveOne("to");
+  const UniqueFd held(::open((dir / ("to/" + left)).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   ASSERT_EQ(::flock(held.get(), LOCK_EX | LOCK_NB), 0);
-  EXPECT_EQ(copy("tree", "copy"), kSuccess);
-  EXPECT_EQ(contentOf(dir / (stage + "/theirs")), "kept");
-  EXPECT_EQ(contentOf(dir / "copy/file"), "x");
+  EXPECT_EQ(copy("tree", "to/copy"), kSuccess);
+  EXPECT_TRUE(isThere(dir / ("to/" + left + "/new")));
+  EXPECT_EQ(contentOf(dir / "to/copy/file"), "x");
+}
+
+TEST_F(LeftoversTest, WhatAStrangerMadeUnderSuchANameIsNeverRemoved) {
+  const std::string left = leaveOne("to");
+  std::filesystem::remove_all(dir / ("to/" + left));
+  std::vector<std::string> planted;
+  const auto plant = [&](const std::string& name) { return planted.emplace_back("to/" + name); };
+  const auto closed = [&](const std::string& path) { ASSERT_EQ(::chmod((dir / path).c_str(), 0700), 0); };
+
+  dir.file(plant(left) + "/theirs", "kept");  // even under a name that has been ours
+  closed("to/" + left);
+  dir.file(plant(".brenvik-0123456789abcdef") + "/new", "open to others");
+  ASSERT_EQ(::chmod((dir / planted.back()).c_str(), 0755), 0);
+  dir.file(plant(".brenvik-0123456789abcde0") + "/new", "and");
+  dir.file(planted.back() + "/more", "kept");
+  closed(planted.back());
+  dir.file(plant(".brenvik-0123456789abcde1"), "a file of a room's name");
+  dir.file(plant(".brenvik-0123456789abcdef-01234567"), "a file with another number");
+  dir.link(plant(".brenvik-0123456789abcde2-01234567"), "target");
+  dir.file(plant(".brenvik-"), "kept");
+  dir.directory(plant(".brenvik-notsixteendigits"));
+  closed(planted.back());
+  dir.link(plant(".brenvik-link-0"), "target");
+  for (int i = 1; i < 4; ++i) dir.file(plant(".brenvik-link-" + std::to_string(i)), "kept");
+  // A file under its own number that has another name, too: somebody else's.
+  char name[64];
+  dir.file("to/precious", "kept");
+  (void)std::snprintf(name, sizeof name, ".brenvik-%016llx-01234567",
+                      static_cast<unsigned long long>(statOf(dir / "to/precious").st_ino));
+  ASSERT_EQ(::link((dir / "to/precious").c_str(), (dir / plant(name)).c_str()), 0);
+  if (::geteuid() == 0) {
+    dir.file(plant(".brenvik-0123456789abcde3") + "/new", "another account's");
+    closed(planted.back());
+    ASSERT_EQ(::chown((dir / planted.back()).c_str(), 4711, 4711), 0);
+  }
+  EXPECT_EQ(copy("tree", "to/copy"), kSuccess);
+  EXPECT_EQ(copy("tree/file", "to/copied"), kSuccess);
+  EXPECT_EQ(copy("tree/file", "to/copied", IfPresent::replaceNonDirectory), kSuccess);
+  EXPECT_EQ(files.placeLink(dir / "to/copied", "target"), kSuccess);
+  for (const std::string& path : planted) EXPECT_TRUE(isThere(dir / path)) << path;
+  EXPECT_EQ(names("to").size(), planted.size() + 3);
+  EXPECT_EQ(contentOf(dir / ("to/" + left + "/theirs")), "kept");
 }
 
 // ---- moves
@@ -526,6 +625,122 @@ TEST_F(LinuxFileManagerTest, AMoveBetweenTwoMountsCopiesThenRemovesTheSource) {
     EXPECT_EQ(contentOf(dir / "disk/single"), "s");
     EXPECT_FALSE(isThere(dir / "single"));
     EXPECT_EQ(names("disk"), (std::vector<std::string>{"single", "tree"}));
+  });
+}
+
+class MoveAcrossTest : public LinuxFileManagerTest {
+ protected:
+  MoveAcrossTest() {
+    dir.file("from/tree/sub/file", "x");
+    dir.file("from/tree/other", "y");
+    dir.directory("disk");
+  }
+  // Mounts the other file system, and on it the source if that is to have one of its own.
+  void expectNotMoved(const std::string& source, const FileOutcome& outcome) {
+    EXPECT_EQ(move(source, "disk/moved", IfPresent::fail), outcome);
+    EXPECT_TRUE(names("disk").empty());
+    EXPECT_EQ(names("from"), (std::vector<std::string>{"tree"}));
+    EXPECT_EQ(names("from/tree"), (std::vector<std::string>{"other", "sub"}));
+    EXPECT_EQ(names("from/tree/sub"), (std::vector<std::string>{"file"}));
+  }
+};
+
+TEST_F(MoveAcrossTest, ASourceThatEndsInDotsIsRefusedBeforeAnythingIsCopied) {
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 1024);
+    for (const char* const source : {"from/tree/.", "from/tree/..", "from/tree/sub/../.", "from/tree/./"}) {
+      expectNotMoved(source, failure(EBUSY));
+    }
+    EXPECT_EQ(files.moveItem("/", dir / "disk/moved", IfPresent::fail), failure(EBUSY));
+    EXPECT_EQ(files.moveItem(".", dir / "disk/moved", IfPresent::fail), failure(EBUSY));
+  });
+  // Nor inside one file system.
+  EXPECT_EQ(move("from/tree/.", "moved"), failure(EBUSY));
+  EXPECT_EQ(contentOf(dir / "from/tree/sub/file"), "x");
+}
+
+TEST_F(MoveAcrossTest, ASourceWithAMountInsideStaysWhole) {
+  dir.directory("elsewhere");
+  dir.file("single", "mounted");
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 1024);
+    const std::string sub = dir / "from/tree/sub";
+    const std::string file = dir / "from/tree/sub/file";
+    ASSERT_EQ(::mount(sub.c_str(), sub.c_str(), nullptr, MS_BIND, nullptr), 0);
+    expectNotMoved("from/tree", failure(EBUSY));
+    expectNotMoved("from/tree/sub", failure(EBUSY));  // the mount itself
+    ASSERT_EQ(::umount(sub.c_str()), 0);
+    ASSERT_EQ(::mount((dir / "single").c_str(), file.c_str(), nullptr, MS_BIND, nullptr), 0);
+    expectNotMoved("from/tree", failure(EBUSY));
+    expectNotMoved("from/tree/sub/file", failure(EBUSY));
+    ASSERT_EQ(::umount(file.c_str()), 0);
+    EXPECT_EQ(move("from/tree", "disk/moved"), kSuccess);
+    EXPECT_TRUE(names("from").empty());
+    EXPECT_EQ(contentOf(dir / "disk/moved/sub/file"), "x");
+  });
+}
+
+TEST_F(MoveAcrossTest, AReadOnlySourceStaysAndNothingIsCopied) {
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 1024);
+    const std::string from = dir / "from";
+    ASSERT_EQ(::mount(from.c_str(), from.c_str(), nullptr, MS_BIND, nullptr), 0);
+    ASSERT_EQ(::mount(nullptr, from.c_str(), nullptr, MS_BIND | MS_REMOUNT | MS_RDONLY, nullptr), 0);
+    expectNotMoved("from/tree", failure(EROFS));
+    expectNotMoved("from/tree/sub/file", failure(EROFS));
+  });
+}
+
+TEST_F(MoveAcrossTest, ASourceWithAnImmutableItemStaysWhole) {
+  const auto mark = [&](const std::string& name, int flag) {
+    const UniqueFd item(::open((dir / name).c_str(), O_RDONLY | O_CLOEXEC));
+    return ::ioctl(item.get(), FS_IOC_SETFLAGS, &flag) == 0;
+  };
+  for (const int flag : {FS_IMMUTABLE_FL, FS_APPEND_FL}) {
+    for (const char* const name : {"from/tree/sub/file", "from/tree/sub", "from/tree"}) {
+      if (!mark(name, flag)) GTEST_SKIP() << "nothing can be made immutable here";
+      inPrivateMounts([&] {
+        mountSmallDisk(dir / "disk", 1024);
+        expectNotMoved("from/tree", failure(EPERM));
+      });
+      EXPECT_TRUE(mark(name, 0));
+    }
+  }
+}
+
+TEST_F(MoveAcrossTest, AnImmutableFolderAroundTheSourceKeepsIt) {
+  const UniqueFd folder(::open((dir / "from").c_str(), O_RDONLY | O_CLOEXEC));
+  int flag = FS_IMMUTABLE_FL;
+  if (::ioctl(folder.get(), FS_IOC_SETFLAGS, &flag) != 0)
+    GTEST_SKIP() << "nothing can be made immutable here";
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 1024);
+    expectNotMoved("from/tree", failure(EPERM));
+  });
+  flag = 0;
+  EXPECT_EQ(::ioctl(folder.get(), FS_IOC_SETFLAGS, &flag), 0);
+}
+
+TEST_F(MoveAcrossTest, AwayFromAFullDiskItWorksAllTheSame) {
+  inPrivateMounts([&] {
+    ASSERT_EQ(::mount("tmpfs", (dir / "disk").c_str(), "tmpfs", 0, "nr_inodes=4"), 0);
+    dir.file("disk/tree/file", "x");
+    dir.file("disk/last", "y");
+    ASSERT_EQ(::mkdir((dir / "disk/no-more").c_str(), 0700), -1);
+    EXPECT_EQ(move("disk/tree", "moved"), kSuccess);
+    EXPECT_EQ(contentOf(dir / "moved/file"), "x");
+    EXPECT_EQ(names("disk"), (std::vector<std::string>{"last"}));
+  });
+}
+
+TEST_F(MoveAcrossTest, IntoItselfByWayOfAnotherMountItStaysWhole) {
+  inPrivateMounts([&] {
+    const std::string sub = dir / "from/tree/sub";
+    ASSERT_EQ(::mount(sub.c_str(), (dir / "disk").c_str(), nullptr, MS_BIND, nullptr), 0);
+    EXPECT_EQ(move("from/tree", "disk/moved"), failure(EINVAL));
+    EXPECT_EQ(copy("from/tree", "disk/moved"), failure(EINVAL));
+    EXPECT_EQ(names("from/tree/sub"), (std::vector<std::string>{"file"}));
+    EXPECT_EQ(contentOf(dir / "from/tree/other"), "y");
   });
 }
 
@@ -693,9 +908,13 @@ TEST_F(LinuxFileManagerTest, KilledAtAnyMomentADirectoryShowsWithItsModeOrNotAtA
       }
     }
     ::waitpid(child, nullptr, 0);
-    for (const auto& entry : std::filesystem::recursive_directory_iterator(dir.path())) {
-      if (entry.path().filename().string().starts_with(".brenvik-")) continue;
-      ASSERT_EQ(statOf(entry.path()).st_mode, S_IFDIR | 0755u) << entry.path() << " in round " << round;
+    auto entry = std::filesystem::recursive_directory_iterator(dir.path());
+    for (; entry != std::filesystem::recursive_directory_iterator(); ++entry) {
+      if (entry->path().filename().string().starts_with(".brenvik-")) {
+        entry.disable_recursion_pending();
+        continue;
+      }
+      ASSERT_EQ(statOf(entry->path()).st_mode, S_IFDIR | 0755u) << entry->path() << " in round " << round;
     }
     std::filesystem::remove_all(dir / "work");
   }

@@ -2,17 +2,21 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 //
 // File systems that know less than the usual ones: no files without a name, no flags of rename, no link to an
-// open file. The calls are refused here, because no such file system is to be had everywhere.
+// open file. The calls are refused here, because no such file system is to be had everywhere. And disks that
+// do not keep what they were given, and processes that are killed between two calls.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cstdarg>
+#include <functional>
 
 #include "platform/base/fakes/FailingCalls.h"
+#include "platform/files/fakes/ChildProcesses.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/files/linux/LinuxFileManager.h"
 
@@ -36,6 +40,19 @@ extern "C" int renameat2(int fromFolder, const char* from, int toFolder, const c
 extern "C" int linkat(int fromFolder, const char* from, int toFolder, const char* to, int flags) noexcept {
   if ((flags & AT_EMPTY_PATH) != 0 && brenvik::FailingCall::failsNow("linkat(AT_EMPTY_PATH)")) return -1;
   return static_cast<int>(::syscall(SYS_linkat, fromFolder, from, toFolder, to, flags));
+}
+
+extern "C" int renameat(int fromFolder, const char* from, int toFolder, const char* to) noexcept {
+  if (brenvik::FailingCall::failsNow("renameat, and death")) ::_exit(9);
+  return static_cast<int>(::syscall(SYS_renameat2, fromFolder, from, toFolder, to, 0));
+}
+extern "C" int fsync(int file) {
+  if (brenvik::FailingCall::failsNow("fsync")) return -1;
+  return static_cast<int>(::syscall(SYS_fsync, file));
+}
+extern "C" int syncfs(int file) noexcept {
+  if (brenvik::FailingCall::failsNow("syncfs")) return -1;
+  return static_cast<int>(::syscall(SYS_syncfs, file));
 }
 
 namespace brenvik {
@@ -134,6 +151,120 @@ TEST_F(PlainFileSystemTest, AnOpenFileThatMayNotBeLinkedIsLinkedByItsPathInProc)
   EXPECT_EQ(copy("source", "old", IfPresent::replaceNonDirectory), kSuccess);
   EXPECT_EQ(contentOf(dir / "old"), "new");
   EXPECT_EQ(names(), (Names{"copy", "old", "source"}));
+}
+
+// ---- killed between two calls
+
+TEST_F(PlainFileSystemTest, WhatAProcessKilledBeforeItsLastRenameLeftGoesWithTheNextOperation) {
+  dir.file("source", "new");
+  dir.file("old", "old");
+  const auto dieWithin = [&](const std::function<void()>& work) {
+    const pid_t child = ::fork();
+    if (child == 0) {
+      const FailingCall death("renameat, and death", EIO);
+      work();
+      ::_exit(0);
+    }
+    int status = 0;
+    ::waitpid(child, &status, 0);
+    EXPECT_EQ(WEXITSTATUS(status), 9);
+    EXPECT_EQ(names().size(), 3u);  // the leftover
+    EXPECT_EQ(contentOf(dir / "old"), "old");
+    EXPECT_EQ(copy("source", "another"), kSuccess);
+    EXPECT_EQ(names(), (Names{"another", "old", "source"}));
+    EXPECT_EQ(files.removeItem(dir / "another"), kSuccess);
+  };
+  dieWithin([&] { (void)files.placeLink(dir / "old", "target"); });
+  dieWithin([&] { (void)copy("source", "old", IfPresent::replaceNonDirectory); });
+  const FailingCall unknown("openat(O_TMPFILE)", EOPNOTSUPP, 0, kAlways);
+  dieWithin([&] { (void)copy("source", "old", IfPresent::replaceNonDirectory); });
+}
+
+// ---- disks that fail
+
+TEST_F(PlainFileSystemTest, ACopyThatDoesNotReachTheDiskShowsNothing) {
+  dir.file("source", "new");
+  dir.file("tree/file", "new");
+  dir.file("old", "old");
+  const auto durably = [&](const char* from, const char* to, IfPresent ifPresent = IfPresent::fail) {
+    return files.copyItem(dir / from, dir / to, ifPresent, Durability::onReturn);
+  };
+  {
+    const FailingCall broken("fsync", EIO);
+    EXPECT_EQ(durably("source", "copy"), FileOutcome::failure(EIO));
+  }
+  {
+    const FailingCall broken("fsync", EIO);
+    EXPECT_EQ(durably("source", "old", IfPresent::replaceNonDirectory), FileOutcome::failure(EIO));
+    EXPECT_EQ(contentOf(dir / "old"), "old");
+  }
+  {
+    const FailingCall broken("syncfs", EIO);
+    EXPECT_EQ(durably("tree", "copy"), FileOutcome::failure(EIO));
+  }
+  EXPECT_EQ(names(), (Names{"old", "source", "tree"}));
+  // A file system that has nothing to wait for.
+  const FailingCall unknown("fsync", EINVAL, 0, kAlways);
+  EXPECT_EQ(durably("source", "copy"), kSuccess);
+  EXPECT_EQ(unknown.failures(), 2);  // the file and its name
+}
+
+TEST_F(PlainFileSystemTest, AnAnswerWaitsForTheNamesAndSaysWhenTheyAreLost) {
+  dir.file("source", "x");
+  dir.directory("to");
+  const auto failsWithout = [&](const char* what, int earlier, const std::function<FileOutcome()>& work) {
+    const FailingCall broken("fsync", EIO, earlier);
+    EXPECT_EQ(work(), FileOutcome::failure(EIO)) << what;
+    EXPECT_EQ(broken.failures(), 1) << what;
+  };
+  failsWithout("copy", 1, [&] {
+    return files.copyItem(dir / "source", dir / "copy", IfPresent::fail, Durability::onReturn);
+  });
+  failsWithout("move", 0, [&] {
+    return files.moveItem(dir / "copy", dir / "to/moved", IfPresent::fail, Durability::onReturn);
+  });
+  failsWithout("move, the folder it left", 1, [&] {
+    return files.moveItem(dir / "to/moved", dir / "moved", IfPresent::fail, Durability::onReturn);
+  });
+  failsWithout("directory", 0,
+               [&] { return files.createDirectory(dir / "made", {}, Intermediates::mustExist); });
+  failsWithout("directories", 1,
+               [&] { return files.createDirectory(dir / "a/b", {}, Intermediates::create); });
+  failsWithout("link", 0, [&] { return files.placeLink(dir / "link", "target"); });
+  failsWithout("replaced link", 0, [&] { return files.placeLink(dir / "link", "other"); });
+  failsWithout("removal", 0, [&] { return files.removeEntry(dir / "link"); });
+  failsWithout("file", 0, [&] { return files.syncItem(dir / "source"); });
+  failsWithout("file's name", 1, [&] { return files.syncItem(dir / "source"); });
+}
+
+TEST_F(PlainFileSystemTest, AMoveAcrossWhoseCopyDoesNotReachTheDiskKeepsTheSource) {
+  dir.file("tree/file", "x");
+  dir.file("single", "s");
+  dir.directory("disk");
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 1024);
+    dir.file("disk/old", "old");
+    const auto staysWhole = [&](const char* call, int earlier, const char* from, const char* to) {
+      const FailingCall broken(call, EIO, earlier);
+      EXPECT_EQ(move(from, to, IfPresent::replaceNonDirectory), FileOutcome::failure(EIO))
+          << call << from << to;
+      EXPECT_EQ(broken.failures(), 1);
+      EXPECT_EQ(contentOf(dir / "tree/file"), "x");
+      EXPECT_EQ(contentOf(dir / "single"), "s");
+      EXPECT_EQ(contentOf(dir / "disk/old"), "old");
+      EXPECT_EQ(names(), (Names{"disk", "single", "tree"}));
+      EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir / "disk"), {}), 1);
+    };
+    for (const char* const to : {"disk/new", "disk/old"}) {
+      staysWhole("syncfs", 0, "tree", to);  // the tree's data
+      staysWhole("fsync", 0, "tree", to);   // its name
+      staysWhole("fsync", 0, "single", to);
+      staysWhole("fsync", 1, "single", to);
+    }
+    EXPECT_EQ(move("tree", "disk/old", IfPresent::replaceNonDirectory), kSuccess);
+    EXPECT_EQ(contentOf(dir / "disk/old/file"), "x");
+    EXPECT_EQ(names(), (Names{"disk", "single"}));
+  });
 }
 
 }  // namespace

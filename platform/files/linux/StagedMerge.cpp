@@ -53,14 +53,18 @@ int mergeStaged(int staged, int destination) {
     }
     // rename(2) takes a whole directory where there is none; an empty one would give way, and does not here.
     if (::renameat2(here.get(), entry.name, destination, entry.name, RENAME_NOREPLACE) == 0) continue;
+    bool isMade = false;
     if (errno == EINVAL || errno == ENOSYS) {
-      if (::mkdirat(destination, entry.name, 0755) != 0 && errno != EEXIST) return errno;
+      isMade = ::mkdirat(destination, entry.name, 0700) == 0;
+      if (!isMade && errno != EEXIST) return errno;
     } else if (errno != EEXIST) {
       return errno;
     }
     const UniqueFd from(::openat(here.get(), entry.name, kOpenDirectory));
     const UniqueFd to(::openat(destination, entry.name, kOpenDirectory));
-    if (!from.isValid() || !to.isValid()) return errno;
+    struct stat info {};
+    if (!from.isValid() || !to.isValid() || ::fstat(from.get(), &info) != 0) return errno;
+    if (isMade && ::fchmod(to.get(), info.st_mode & 0777) != 0) return errno;
     if (const int error = mergeStaged(from.get(), to.get()); error != 0) return error;
   }
   return 0;

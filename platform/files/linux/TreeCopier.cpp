@@ -176,13 +176,30 @@ void TreeCopier::learnUmask(int directory) {
   if (probe.isValid() && ::fstat(probe.get(), &info) == 0) umask_ = 0777 & ~info.st_mode;
 }
 
+// Whether the item (`name` empty: the descriptor's own) can be removed later on. 0 or errno.
+int TreeCopier::checkRemovable(int directory, const char* name) const {
+  if (afterwards_ == Source::stays) return 0;
+  struct statx info {};
+  if (::statx(directory, name, AT_EMPTY_PATH | AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT, STATX_TYPE, &info) !=
+      0) {
+    return errno;
+  }
+  if ((info.stx_attributes & STATX_ATTR_MOUNT_ROOT) != 0) return EBUSY;
+  if ((info.stx_attributes & (STATX_ATTR_IMMUTABLE | STATX_ATTR_APPEND)) != 0) return EPERM;
+  // What is in a directory goes only if the directory may be written.
+  if (S_ISDIR(info.stx_mode) && ::faccessat(directory, ".", W_OK | X_OK, AT_EACCESS) != 0) return errno;
+  return 0;
+}
+
 int TreeCopier::copyFileInto(int source, const struct stat& info, int destination) {
+  if (const int error = checkRemovable(source, ""); error != 0) return error;
   if (const int error = contents_.copyData(source, info, destination); error != 0) return error;
   return contents_.copyAttributes(source, info, destination, FileContents::Owner::asSource);
 }
 
 int TreeCopier::copySpecial(int sourceDirectory, const char* name, const struct stat& info,
                             int destinationDirectory, const char* destinationName) {
+  if (const int error = checkRemovable(sourceDirectory, name); error != 0) return error;
   if (S_ISLNK(info.st_mode)) {
     char target[PATH_MAX];
     const ssize_t length = ::readlinkat(sourceDirectory, name, target, sizeof target - 1);
@@ -213,6 +230,7 @@ int TreeCopier::copyRegular(FileContents& contents, int from, int to, const char
   struct stat info {};
   if (!file.isValid() || ::fstat(file.get(), &info) != 0) return errno;
   if (!S_ISREG(info.st_mode)) return EBUSY;  // replaced under our hands
+  if (const int error = checkRemovable(file.get(), ""); error != 0) return error;
   if (hasSeveralNames != nullptr && info.st_nlink > 1) {
     *hasSeveralNames = true;
     return 0;
@@ -231,6 +249,7 @@ int TreeCopier::copyRegular(FileContents& contents, int from, int to, const char
 int TreeCopier::copyAgain(int from, int to, const char* name, const std::string& pathHere) {
   struct stat info {};
   if (::fstatat(from, name, &info, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+  if (const int error = checkRemovable(from, name); error != 0) return error;
   if (info.st_nlink > 1) {
     const auto [known, isFirst] =
         linked_.try_emplace({info.st_dev, info.st_ino}, pathHere.empty() ? name : pathHere + "/" + name);
@@ -277,9 +296,14 @@ int TreeCopier::copyDirectoryInto(int source, const struct stat& info, int desti
   linked_.clear();
   top_ = destination;
   learnUmask(destination);
+  struct stat top {};
+  if (::fstat(destination, &top) != 0) return errno;
   Crew crew(*this, contents_);
   std::vector<Level> levels;
   const auto enter = [&](UniqueFd from, UniqueFd to, const struct stat& about, std::string path) {
+    if (const int error = checkRemovable(from.get(), ""); error != 0) return error;
+    // By way of another mount of the same file system the copy may come to stand inside its source.
+    if (about.st_dev == top.st_dev && about.st_ino == top.st_ino) return EINVAL;
     if (levels.size() >= kHeldLevels) {
       Level& far = levels[levels.size() - kHeldLevels];
       if (const int error = far.source.giveUp(); error != 0) return error;

@@ -19,9 +19,14 @@ namespace brenvik {
 // std::bad_alloc.
 class TreeCopier {
  public:
+  enum class Source {
+    stays,
+    goes  // will be removed: an item that cannot be (a mount, an immutable one) is a failure here already
+  };
+
   // The owner of a file that this process makes, so that most files need no change of owner.
-  TreeCopier(FileContents& contents, uid_t ownUid, gid_t ownGid)
-      : contents_(contents), ownUid_(ownUid), ownGid_(ownGid) {}
+  TreeCopier(FileContents& contents, uid_t ownUid, gid_t ownGid, Source afterwards = Source::stays)
+      : contents_(contents), ownUid_(ownUid), ownGid_(ownGid), afterwards_(afterwards) {}
 
   // Copies the regular file, its attributes included, into a file just made. 0 or errno.
   int copyFileInto(int source, const struct stat& info, int destination);
@@ -40,6 +45,7 @@ class TreeCopier {
   class Crew;
 
   void learnUmask(int directory);
+  int checkRemovable(int directory, const char* name) const;
   int copyRegular(FileContents& contents, int from, int to, const char* name, bool* hasSeveralNames) const;
   int copyAgain(int from, int to, const char* name, const std::string& pathHere);
   // Everything in the level's directory but the directories, unless its files are handed over.
@@ -48,6 +54,7 @@ class TreeCopier {
   FileContents& contents_;
   const uid_t ownUid_;
   const gid_t ownGid_;
+  const Source afterwards_;
   int top_ = -1;                                           // where directories are copied to
   mode_t umask_ = 0777;                                    // what creation takes from a mode
   std::map<std::pair<dev_t, ino_t>, std::string> linked_;  // files with several names: the first copy's path

@@ -25,6 +25,9 @@ namespace {
 
 constexpr std::size_t kCompanionHead = 64 << 10;
 constexpr std::uint64_t kWorthReserving = 1 << 20;
+constexpr mode_t kOwnerMayAdd = 0300;
+// As many paths of directories as are kept; more than that no bundle has.
+constexpr std::size_t kMostClosed = 1000;
 
 // The same step by step, for a service manager's filter against set-id files: it cannot look into the
 // arguments of openat2(2) and refuses the call whole. Nothing else writes in the stage meanwhile.
@@ -120,10 +123,30 @@ int UnpackWriter::makeFile(const char* name, mode_t mode, UniqueFd* file) {
   return (umask_ & mode) == 0 || ::fchmod(file->get(), mode) == 0 ? 0 : errno;
 }
 
+int UnpackWriter::setDirectoryMode(const std::string& path, mode_t mode) {
+  const UniqueFd directory = openBeneath(top_, path.c_str(), O_RDONLY | O_DIRECTORY);
+  return directory.isValid() && ::fchmod(directory.get(), mode) == 0 ? 0 : errno;
+}
+
+int UnpackWriter::finish() {
+  // From below: the way to a directory leads through those above it.
+  for (auto it = closed_.rbegin(); it != closed_.rend(); ++it) {
+    if (const int error = setDirectoryMode(it->first, it->second); error != 0) return error;
+  }
+  return 0;
+}
+
 int UnpackWriter::start(const ArchiveEntry& entry) {
   if (!isCleanEntryPath(entry.path)) return EPERM;
   if (entry.kind == Kind::link && !staysInside(entry.path, entry.target)) return EPERM;
-  if (entry.kind == Kind::directory) return openParent(entry.path);
+  if (entry.kind == Kind::directory) {
+    if (const int error = openParent(entry.path); error != 0) return error;
+    if ((entry.mode & kOwnerMayAdd) == kOwnerMayAdd || closed_.size() >= kMostClosed) {
+      return setDirectoryMode(entry.path, entry.mode);
+    }
+    closed_[entry.path] = entry.mode;
+    return 0;
+  }
   const std::size_t slash = entry.path.rfind('/');
   const std::string above = slash == std::string::npos ? std::string() : entry.path.substr(0, slash);
   name_ = slash == std::string::npos ? entry.path : entry.path.substr(slash + 1);
@@ -131,7 +154,7 @@ int UnpackWriter::start(const ArchiveEntry& entry) {
   if (entry.kind == Kind::link) {
     return ::symlinkat(entry.target.c_str(), parent_.get(), name_.c_str()) == 0 ? 0 : errno;
   }
-  return makeFile(name_.c_str(), entry.isExecutable ? 0755 : 0644, &file_);
+  return makeFile(name_.c_str(), entry.mode, &file_);
 }
 
 int UnpackWriter::beginEntry(const ArchiveEntry& entry) {
@@ -176,7 +199,7 @@ int UnpackWriter::entryCompanion(std::string_view bytes) {
     const std::string name =
         "._" + (slash == std::string::npos ? entry_.path : entry_.path.substr(slash + 1));
     if (const int error = openParent(above); error != 0) return error;
-    if (const int error = makeFile(name.c_str(), 0644, &companion_); error != 0) {
+    if (const int error = makeFile(name.c_str(), entry_.mode & 0666, &companion_); error != 0) {
       if (!isFileError(error)) return error;
       skipping_ = true;
       if (file_.isValid()) {

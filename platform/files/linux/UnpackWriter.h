@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <string>
 
 #include "platform/base/UniqueFd.h"
@@ -18,8 +19,9 @@ struct UnpackOptions {
 };
 
 // Writes an archive's entries beneath a directory that nobody else writes to, and nowhere else: every path is
-// checked, and the kernel is told to follow no link and leave no subtree. Files get mode 0644 or 0755 and
-// their time; directories 0755. One thread; may throw std::bad_alloc.
+// checked, and the kernel is told to follow no link and leave no subtree. Files get their time and, like
+// directories, the permission bits that the archive has; directories without an entry get 0755. One thread;
+// may throw std::bad_alloc.
 class UnpackWriter final : public ArchiveFrameSink {
  public:
   static constexpr std::uint64_t kMostEntries = 100'000;
@@ -35,6 +37,8 @@ class UnpackWriter final : public ArchiveFrameSink {
   int entryCompanion(std::string_view bytes) override;
   int endEntry() override;
   int refuseEntry(const std::string& path, int code) override;
+  // After the last entry. 0 or errno.
+  int finish();
 
   // Whether what ended the copy was an answer of onFileError; then there is nothing more to say about it.
   bool wasStoppedByAnswer() const { return stoppedByAnswer_; }
@@ -44,6 +48,7 @@ class UnpackWriter final : public ArchiveFrameSink {
   int start(const ArchiveEntry& entry);
   int openParent(const std::string& directory);
   int makeFile(const char* name, mode_t mode, UniqueFd* file);
+  int setDirectoryMode(const std::string& path, mode_t mode);
   int finishEntry();
   int count(std::uint64_t bytes);
 
@@ -56,6 +61,8 @@ class UnpackWriter final : public ArchiveFrameSink {
   std::uint64_t entries_ = 0;
   std::uint64_t bytes_ = 0;
   bool stoppedByAnswer_ = false;
+
+  std::map<std::string, mode_t> closed_;  // directories that an ordinary user could not write into any more
 
   std::string parentPath_;  // of parent_
   UniqueFd parent_;

@@ -13,6 +13,7 @@
 #include <new>
 #include <vector>
 
+#include "platform/files/linux/Durability.h"
 #include "platform/files/linux/Placement.h"
 #include "platform/files/linux/ReaderProcess.h"
 #include "platform/files/linux/StagedMerge.h"
@@ -106,13 +107,13 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
   UniqueFd existing(::open(destination.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (existing.isValid()) {
     place.directory.reset(::openat(existing.get(), ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
-    place.name = ".unpacked";  // only names the stage
     if (!place.directory.isValid()) return errno;
   } else {
     if (errno != ENOENT) return errno;
     if (const int error = findMissing(destination, &missing); error != 0) return error;
   }
 
+  removeLeftovers(place.directory.get());
   Stage stage(place);
   if (const int error = stage.makeDirectory(); error != 0) return error;
   struct statvfs disk {};
@@ -131,12 +132,20 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
     *wasAnswered = writer.wasStoppedByAnswer();
     if (error != 0) return error;
   }
+  if (const int error = writer.finish(); error != 0) return error;
   if (existing.isValid()) {
     if (const int error = checkMerge(stage.get(), existing.get()); error != 0) return error;
-    return mergeStaged(stage.get(), existing.get());
+  } else if (::fchmod(stage.get(), kDirectoryMode) != 0) {
+    return errno;
   }
-  if (::fchmod(stage.get(), kDirectoryMode) != 0) return errno;
-  return stage.publish(IfPresent::fail);
+  // Before a name shows, what it stands for is on the disk; and the answer waits for the names.
+  if (const int error = syncFileSystem(stage.get()); error != 0) return error;
+  if (existing.isValid()) {
+    if (const int error = mergeStaged(stage.get(), existing.get()); error != 0) return error;
+    return syncFileSystem(existing.get());
+  }
+  if (const int error = stage.publish(IfPresent::fail); error != 0) return error;
+  return syncNames(place.directory.get());
 }
 
 int ZipArchiveCopier::copy(const std::string& archive, const std::string& destination,

@@ -77,10 +77,12 @@ std::string frame(archive_frame::Type type, const std::string& bytes) {
 }
 
 std::string entryFrame(const std::string& path, std::uint64_t size = archive_frame::kUnknownSize,
-                       archive_frame::Kind kind = archive_frame::Kind::file, const std::string& target = "") {
+                       archive_frame::Kind kind = archive_frame::Kind::file, const std::string& target = "",
+                       std::uint16_t mode = 0644) {
   archive_frame::EntryHead head{};
   head.size = size;
   head.modified = 1'000'000'000;
+  head.mode = mode;
   head.kind = kind;
   head.pathLength = static_cast<std::uint16_t>(path.size());
   head.targetLength = static_cast<std::uint16_t>(target.size());
@@ -90,6 +92,24 @@ std::string entryFrame(const std::string& path, std::uint64_t size = archive_fra
 
 const std::string kEndOfEntry = frame(archive_frame::Type::endOfEntry, "");
 const std::string kEnd = frame(archive_frame::Type::end, "");
+
+// A companion as packers write it, with one attribute.
+std::string companionWith(const std::string& attribute, const std::string& value) {
+  const auto be = [](std::uint32_t number, int bytes) {
+    std::string out;
+    for (int i = bytes - 1; i >= 0; --i) out += static_cast<char>(number >> (8 * i) & 0xFF);
+    return out;
+  };
+  const std::string name = attribute + std::string(1, '\0');
+  const auto valueAt = static_cast<std::uint32_t>((50 + 34 + 36 + 11 + name.size() + 3) & ~std::size_t{3});
+  std::string out = be(0x00051607, 4) + be(0x00020000, 4) + std::string(16, ' ') + be(2, 2);
+  out += be(9, 4) + be(50, 4) + be(200, 4) + be(2, 4) + be(0, 4) + be(0, 4);
+  out += std::string(34, '\0') + be(0x41545452, 4) + std::string(28, '\0') + be(0, 2) + be(1, 2);
+  out += be(valueAt, 4) + be(static_cast<std::uint32_t>(value.size()), 4) + be(0, 2) +
+         be(static_cast<std::uint32_t>(name.size()), 1) + name;
+  out.resize(valueAt, '\0');
+  return out + value;
+}
 
 // ---- what is unpacked
 
@@ -111,6 +131,48 @@ TEST_F(ZipArchiveCopierTest, FilesFoldersLinksModesAndTimesComeOut) {
   EXPECT_LT(statOf(dir / "out/a.txt").st_mtime, 1'800'000'000);
   EXPECT_TRUE(fileErrors.empty());
   EXPECT_EQ(fatal, std::nullopt);
+}
+
+TEST_F(ZipArchiveCopierTest, PermissionBitsStayAndWhatIsPrivateStaysPrivate) {
+  ZipBuilder zip;
+  zip.file("secret", "s", 0100600).file("shared", "s", 0100664).file("locked", "l", 0100400);
+  zip.file("run", "#!", 0100711);
+  zip.add({.name = "hidden/", .content = "", .mode = 040700}).file("hidden/below", "x", 0100640);
+  zip.add({.name = "drop/", .content = "", .mode = 041777});
+  zip.add({.name = "closed/", .content = "", .mode = 040555});
+  zip.add({.name = "closed/deeper/", .content = "", .mode = 040500}).file("closed/deeper/file", "x");
+  zip.file("without/entry", "x");
+  zip.file("__MACOSX/._secret", companionWith("note", "value"));
+  const auto check = [&] {
+    const std::pair<const char*, mode_t> expected[] = {{"secret", S_IFREG | 0600},
+                                                       {"._secret", S_IFREG | 0600},
+                                                       {"shared", S_IFREG | 0664},
+                                                       {"locked", S_IFREG | 0400},
+                                                       {"run", S_IFREG | 0711},
+                                                       {"hidden", S_IFDIR | 0700},
+                                                       {"hidden/below", S_IFREG | 0640},
+                                                       {"drop", S_IFDIR | 0777},
+                                                       {"closed", S_IFDIR | 0555},
+                                                       {"closed/deeper", S_IFDIR | 0500},
+                                                       {"closed/deeper/file", S_IFREG | 0644},
+                                                       {"without", S_IFDIR | 0755}};
+    for (const auto& [name, mode] : expected) {
+      EXPECT_EQ(statOf(dir / ("out/" + std::string(name))).st_mode, mode) << name;
+    }
+  };
+  for (const mode_t mask : {0022u, 0077u, 0000u}) {
+    const mode_t before = ::umask(mask);
+    EXPECT_EQ(unpack(zip.build()), 0);
+    ::umask(before);
+    check();
+    std::filesystem::permissions(dir / "out/closed", std::filesystem::perms::owner_all);
+    std::filesystem::permissions(dir / "out/closed/deeper", std::filesystem::perms::owner_all);
+    std::filesystem::remove_all(dir / "out");
+  }
+  if (::geteuid() != 0) return;  // moving a directory that is closed to its owner
+  dir.file("out/kept", "kept");
+  EXPECT_EQ(unpack(zip.build()), 0);
+  check();
 }
 
 TEST_F(ZipArchiveCopierTest, NamesThatAreNotAsciiComeOutWithAndWithoutTheUtf8Flag) {
@@ -137,7 +199,7 @@ TEST_F(ZipArchiveCopierTest, BackslashesSeparateNamesAndWhatCameFromAPipeIsAFile
   zip.file("folder\\file", "content").add({.name = "piped", .content = "p", .mode = 010666});
   EXPECT_EQ(unpack(zip.build()), 0);
   EXPECT_EQ(contentOf(dir / "out/folder/file"), "content");
-  EXPECT_EQ(statOf(dir / "out/piped").st_mode, S_IFREG | 0644u);
+  EXPECT_EQ(statOf(dir / "out/piped").st_mode, S_IFREG | 0666u);
 }
 
 TEST_F(ZipArchiveCopierTest, LargeFilesComeOutByteForByte) {
@@ -209,23 +271,6 @@ TEST_F(ZipArchiveCopierTest, AConflictWithWhatIsThereChangesNothing) {
 }
 
 // ---- resource data
-
-std::string companionWith(const std::string& attribute, const std::string& value) {
-  const auto be = [](std::uint32_t number, int bytes) {
-    std::string out;
-    for (int i = bytes - 1; i >= 0; --i) out += static_cast<char>(number >> (8 * i) & 0xFF);
-    return out;
-  };
-  const std::string name = attribute + std::string(1, '\0');
-  const auto valueAt = static_cast<std::uint32_t>((50 + 34 + 36 + 11 + name.size() + 3) & ~std::size_t{3});
-  std::string out = be(0x00051607, 4) + be(0x00020000, 4) + std::string(16, ' ') + be(2, 2);
-  out += be(9, 4) + be(50, 4) + be(200, 4) + be(2, 4) + be(0, 4) + be(0, 4);
-  out += std::string(34, '\0') + be(0x41545452, 4) + std::string(28, '\0') + be(0, 2) + be(1, 2);
-  out += be(valueAt, 4) + be(static_cast<std::uint32_t>(value.size()), 4) + be(0, 2) +
-         be(static_cast<std::uint32_t>(name.size()), 1) + name;
-  out.resize(valueAt, '\0');
-  return out + value;
-}
 
 TEST_F(ZipArchiveCopierTest, ACompanionsResourceDataStandsBesideItsFileAndItsAttributesOnIt) {
   const std::string companion = companionWith("com.example.note", "value");
@@ -489,6 +534,7 @@ TEST_F(ZipArchiveCopierTest, FramesThatNoCorrectReaderSendsAreAFatalErrorAndLeav
         kEndOfEntry + kEnd,
         entryFrame("d", 0, archive_frame::Kind::directory) + frame(archive_frame::Type::data, "x"),
         entryFrame("file", 0, archive_frame::Kind{7}),
+        entryFrame("file", 0, archive_frame::Kind::file, "", 04644) + kEndOfEntry + kEnd,
         entryFrame("a", 0, archive_frame::Kind::file, "target"),
         frame(archive_frame::Type::failed, std::string("\5\0\0\0", 4))}) {
     EXPECT_NE(copyFrames(frames), 0);

@@ -142,7 +142,7 @@ int describe(archive_entry* entry, EntryHead* head, std::string* names) {
           : archive_frame::kUnknownSize;
   head->modified =
       ::archive_entry_mtime_is_set(entry) != 0 ? ::archive_entry_mtime(entry) : archive_frame::kNoTime;
-  head->isExecutable = (::archive_entry_perm(entry) & 0100) != 0;
+  head->mode = static_cast<std::uint16_t>(::archive_entry_perm(entry) & 0777);  // the sticky bit is left out
   head->pathLength = static_cast<std::uint16_t>(pathLength);
   head->targetLength = static_cast<std::uint16_t>(target.size());
   names->assign(path, pathLength);
