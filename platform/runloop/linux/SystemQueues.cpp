@@ -194,7 +194,7 @@ class SystemQueues::Maker {
   std::shared_ptr<WorkQueue> global_;
 };
 
-static_assert(SystemQueues::kReservedDescriptors == 9 * EventLoop::kDescriptorsForAnotherThread,
+static_assert(SystemQueues::kReservedDescriptors == 9 * EventLoop::kDescriptors,
               "as many queues as the helper ever has at a time");
 
 namespace {
