@@ -206,8 +206,6 @@ TEST_F(SystemQueuesTest, ATimerThatIsDueHasItsTurnBetweenDescriptorsThatAreAlway
   const auto b = loop->addDescriptor(second.get(), EPOLLIN, [&](std::uint32_t) { ++served; });
   int ticks = 0;
   const auto timer = loop->addTimer(0s, 1ns, [&] { ++ticks; }, {});
-  while (ticks == 0) (void)loop->run(0s, ReturnAfterSource::yes);
-  ticks = served = 0;
   for (int i = 0; i < 3000; ++i) (void)loop->run(0s, ReturnAfterSource::yes);
   EXPECT_EQ(ticks + served, 3000);
   EXPECT_GT(ticks, 300);
