@@ -4,7 +4,7 @@
 // The floor that the daemon is measured against: a blocking SOCK_SEQPACKET server that looks at nothing. It
 // takes the connection that waits at descriptor 3, answers its first message with the 40 bytes and the right
 // of a check-in's reply, and then answers a request of 24 bytes with a full datagram and any other with 36
-// bytes. It is linked with the libraries that the daemon is linked with.
+// bytes. It has the C library and no other.
 #include <sys/socket.h>
 #include <unistd.h>
 

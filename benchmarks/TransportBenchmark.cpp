@@ -4,7 +4,7 @@
 // What a client waits for, everything on one processor: a call to the real daemon beside a bare blocking
 // ping-pong over the same kind of socket and beside sd-bus, peer to peer; a reply with a region of all that
 // fits a datagram, through the real transport, beside a bare one of the same bytes; and the time from the
-// start of the daemon to its first answer, beside a bare server that is linked alike.
+// start of the daemon to its first answer, beside a bare server that needs the C library alone.
 //
 // The daemon and the bare server are programs of this build, started as a service manager starts them. The
 // daemon admits this program by an entitlement file that is written for the time being, so it wants the
@@ -50,7 +50,7 @@ using Clock = std::chrono::steady_clock;
 constexpr double kMostOfBare = 1.25;
 constexpr double kMostOfBus = 0.55;
 constexpr double kMostOfBareRegion = 1.15;
-constexpr double kMostOfBareStart = 1.2;
+constexpr double kMostOfBareStart = 1.35;
 
 constexpr const char kEntitlementFile[] = "/etc/brenvik/entitlements.d/50-transport-benchmark.plist";
 

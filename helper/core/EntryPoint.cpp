@@ -9,6 +9,13 @@
 #include "platform/log/Log.h"
 
 namespace brenvik {
+namespace {
+
+void logFailureToStart() noexcept {
+  logUnified(LogLevel::error, "unable to startup BrenvikMobileHelper server");
+}
+
+}  // namespace
 
 int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests,
               const std::function<void()>& endWork) {
@@ -36,8 +43,17 @@ int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const R
   }
 
   if (hosted != nullptr) hosted->stop();
-  if (status != 0) logUnified(LogLevel::error, "unable to startup BrenvikMobileHelper server");
+  if (status != 0) logFailureToStart();
   return status;
+}
+
+int runReportingFailure(const std::function<int()>& work) noexcept {
+  try {
+    return work();
+  } catch (...) {
+    logFailureToStart();
+    return 1;
+  }
 }
 
 }  // namespace brenvik

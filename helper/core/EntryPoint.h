@@ -18,4 +18,8 @@ namespace brenvik {
 int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests,
               const std::function<void()>& endWork);
 
+// Runs the process's work and returns its exit status; an exception that comes out of it is logged as the
+// failure to start that it is, and becomes 1. The log sink must outlive this call.
+int runReportingFailure(const std::function<int()>& work) noexcept;
+
 }  // namespace brenvik

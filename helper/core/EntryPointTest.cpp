@@ -4,7 +4,9 @@
 
 #include <gtest/gtest.h>
 
+#include <new>
 #include <optional>
+#include <stdexcept>
 
 #include "platform/base/fakes/FailingAllocations.h"
 #include "platform/baseband/fakes/FakeBaseband.h"
@@ -139,6 +141,24 @@ TEST_F(EntryPointTest, WithoutMemoryForTheIdleCheckNothingIsServedAndTheStatusIs
   EXPECT_EQ(registry.size(), 0U);
   EXPECT_EQ(baseband.record, "canHost create start stop release ");
   EXPECT_EQ(loop.runs, 0);
+}
+
+TEST_F(EntryPointTest, AnExceptionOutOfTheWorkIsToldInTheLogAndMakesTheStatus1) {
+  const std::function<int()> works[] = {[]() -> int { throw std::bad_alloc(); },
+                                        []() -> int { throw std::runtime_error("a reason of its own"); },
+                                        []() -> int { throw 7; }};
+  for (const auto& work : works) {
+    EXPECT_EQ(runReportingFailure(work), 1);
+    EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
+                                 LogLevel::error, "unable to startup BrenvikMobileHelper server")});
+    log.clear();
+  }
+}
+
+TEST_F(EntryPointTest, TheStatusOfWorkThatEndsIsItsOwnAndNothingIsLogged) {
+  EXPECT_EQ(runReportingFailure([] { return 0; }), 0);
+  EXPECT_EQ(runReportingFailure([] { return 1; }), 1);
+  EXPECT_TRUE(log.entries().empty());
 }
 
 }  // namespace

@@ -8,8 +8,6 @@
 #include <algorithm>
 #include <chrono>
 #include <csignal>
-#include <cstdio>
-#include <exception>
 #include <memory>
 #include <string>
 
@@ -24,6 +22,7 @@
 #include "helper/mobile/MobileUser.h"
 #include "helper/requests/RequestTable.h"
 #include "platform/accounts/linux/PasswordDatabase.h"
+#include "platform/base/Environment.h"
 #include "platform/baseband/linux/LoadedBasebandLibrary.h"
 #include "platform/contacts/linux/SqliteContacts.h"
 #include "platform/files/linux/LinuxFileManager.h"
@@ -155,9 +154,6 @@ class Areas {
 
 int run() {
   prepareProcess();
-  SystemLog log("BrenvikMobileHelper");
-  setLogSink(&log);
-
   const auto loop = SystemRunLoop::make();
   if (loop == nullptr) {
     logUnified(LogLevel::error, "unable to startup BrenvikMobileHelper server");
@@ -184,19 +180,19 @@ int run() {
                                       return entitlements.HasEntitlement(entitlement, caller);
                                     },
                                 .idlePeriod = std::chrono::milliseconds(BRENVIK_IDLE_MILLISECONDS)};
-  const int status = runHelper(baseband, platform, requests, [&requests] { requests.shutDown(); });
-  setLogSink(nullptr);
-  return status;
+  return runHelper(baseband, platform, requests, [&requests] { requests.shutDown(); });
 }
 
 }  // namespace
 }  // namespace brenvik
 
 int main() {
-  try {
-    return brenvik::run();
-  } catch (const std::exception& error) {
-    std::fprintf(stderr, "<3>unable to startup BrenvikMobileHelper server: %s\n", error.what());
-    return 1;
-  }
+  // First of all: nothing that comes later is to find anything there. These are the service manager's way to
+  // hand over the listening socket, and go when that has been taken.
+  brenvik::clearEnvironmentExcept({"LISTEN_PID", "LISTEN_FDS", "LISTEN_FDNAMES"});
+  brenvik::SystemLog log("BrenvikMobileHelper");
+  brenvik::setLogSink(&log);
+  const int status = brenvik::runReportingFailure(brenvik::run);
+  brenvik::setLogSink(nullptr);
+  return status;
 }

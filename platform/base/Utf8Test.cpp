@@ -32,6 +32,17 @@ TEST(Utf8Test, RefusesASequenceCutOffByTheEnd) {
   }
 }
 
+TEST(Utf8Test, TheFirstCharactersLengthIsToldWhateverFollowsIt) {
+  EXPECT_EQ(utf8CharacterLength(""), 0U);
+  EXPECT_EQ(utf8CharacterLength(std::string_view("\0", 1)), 1U);
+  EXPECT_EQ(utf8CharacterLength("a\xFF"), 1U);
+  EXPECT_EQ(utf8CharacterLength("\xC3\xA9\xFF"), 2U);
+  EXPECT_EQ(utf8CharacterLength("\xE2\x82\xAC\xFF"), 3U);
+  EXPECT_EQ(utf8CharacterLength("\xF0\x9F\x98\x80\xFF"), 4U);
+  EXPECT_EQ(utf8CharacterLength("\xF0\x9F\x98"), 0U);
+  EXPECT_EQ(utf8CharacterLength("\xA9"), 0U);
+}
+
 TEST(Utf8Test, AFieldEndsAtItsFirstNulOrAtItsLastByte) {
   const char field[4] = {'a', 'b', 'c', 'd'};
   EXPECT_EQ(textOfField(field, 4), "abcd");

@@ -124,6 +124,10 @@ class Bundles(CarrierTest):
         self.assertEqual(self.caller.status("RemoveCarrierFile", long(victim), long("com.norvale.carrier")), 8)
         self.assertEqual(victim.read_text(), "kept")
         self.logs.wait_for("bsd", LOG_NOTICE, "Removing domain: com.norvale.carrier")
+
+    def test_a_domain_cannot_disturb_the_log(self):
+        self.assertEqual(self.caller.status("RemoveCarrierFile", long("/nowhere"), long("a\n\u202eb\u2029")), 8)
+        self.logs.wait_for("bsd", LOG_NOTICE, "Removing domain: a\\x0a\\xe2\\x80\\xaeb\\xe2\\x80\\xa9")
         self.logs.wait_for("unified", ERROR, "/private/var/mobile/Library/Carrier Bundles")
         package = pathlib.Path("/tmp/update.tcpk")
         package.write_text("x")

@@ -112,6 +112,21 @@ class UpdateTest(HelperTest):
         self.assertFalse(DIRECTORY.exists())
 
 
+class Environment(UpdateTest):
+    def test_nothing_in_it_changes_a_download_or_tells_of_its_keys(self):
+        keys = pathlib.Path("/tmp/keys")
+        self.daemon.stop()
+        proxies = {name: "http://127.0.0.1:9" for name in ("https_proxy", "HTTPS_PROXY", "all_proxy", "ALL_PROXY")}
+        self.daemon = Daemon(environment={
+            **proxies, "SSLKEYLOGFILE": str(keys), "SSL_CERT_FILE": "/nowhere", "SSL_CERT_DIR": "/nowhere",
+            "CURL_CA_BUNDLE": "/nowhere", "OPENSSL_CONF": "/nowhere", "RES_OPTIONS": "use-vc", "HOSTALIASES": "/nowhere",
+            "HOME": "/nowhere", "CURL_HOME": "/nowhere", "TZ": "Nowhere/Nothing"})
+        manifest = self.serve({"gsm": 1})
+        self.assertEqual(self.check(), ["UpdateAvailable gsm"])
+        self.assert_installed(manifest)
+        self.assertFalse(keys.exists())
+
+
 class Updates(UpdateTest):
     def test_all_five_are_installed_and_announced_in_order_and_a_second_check_finds_nothing_to_do(self):
         self.assertNotIn("libcurl", self.daemon.maps())

@@ -189,6 +189,13 @@ class PlistFiles(HelperTest):
             self.client().load_plist("/tmp/a\nb\x1b[31m\u009b31m\u00a0\u00e9\x7f")
         self.logs.wait_for("unified", INFO, "Loading /tmp/a\\x0ab\\x1b[31m\\xc2\\x9b31m\u00a0\u00e9\\x7f as plist")
 
+    def test_characters_that_turn_the_direction_of_text_or_end_a_line_are_escaped_in_the_log(self):
+        path = "/tmp/\u05e9\u202egpj.exe\u2066\u200f\u061c\u2028\u2029"
+        with self.assertRaises(wire.Status):
+            self.client().load_plist(path)
+        self.logs.wait_for("unified", INFO, "Loading /tmp/\u05e9\\xe2\\x80\\xaegpj.exe\\xe2\\x81\\xa6\\xe2\\x80\\x8f"
+                           "\\xd8\\x9c\\xe2\\x80\\xa8\\xe2\\x80\\xa9 as plist")
+
 
 class RadioLogs(HelperTest):
     def test_any_value_is_logged_as_received_and_no_bus_is_no_failure(self):

@@ -170,8 +170,8 @@ class HostedBaseband(HelperTest):
         self.addCleanup(shutil.rmtree, self.folder)
         shutil.copy(BUILD / "unit/baseband_standin_whole.so", self.folder / HOSTED)
         self.calls, self.busy = self.folder / "calls", self.folder / "busy"
-        self.environment = {"LD_LIBRARY_PATH": str(self.folder), "BASEBAND_STANDIN_CALLS": str(self.calls),
-                            "BASEBAND_STANDIN_BUSY": str(self.busy)}
+        self.calls.touch()
+        self.environment = {"LD_LIBRARY_PATH": str(self.folder)}
 
     def host(self):
         self.daemon.stop()
@@ -196,6 +196,22 @@ class HostedBaseband(HelperTest):
         self.addCleanup(second.stop)
         self.assertEqual(second.wait(), 1)
         self.assertEqual(self.calls.read_text(), "?csxr")
+
+    def test_a_library_finds_nothing_in_the_environment(self):
+        found = self.folder / "environment"
+        found.touch()
+        self.environment |= {"SSLKEYLOGFILE": "/tmp/keys", "https_proxy": "http://proxy", "TZ": "Asia/Tokyo",
+                             "LD_BIND_NOW": "1", "LISTEN_PID": "1", "LISTEN_FDS": "1"}
+        self.daemon.stop()
+        self.daemon = Daemon(environment=self.environment)
+        self.assertEqual(self.calls.read_text(), "?cs")
+        # How a service manager hands over sockets is what the helper may read, and has yet to.
+        self.assertEqual(set(found.read_bytes().split(b"\0")), {b"", b"LISTEN_PID=1", b"LISTEN_FDS=1"})
+        self.busy.touch()
+        found.write_bytes(b"")
+        self.client().close()
+        eventually(lambda: self.calls.read_text() == "?csb", TICK + 5, "the first tick's question")
+        self.assertEqual(found.read_bytes(), b"")
 
 
 if __name__ == "__main__":

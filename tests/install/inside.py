@@ -402,6 +402,11 @@ def works_for_the_whole_phone():
         with bus.accept()[0] as connection:
             connection.settimeout(10)
             expect(connection.recv(64).startswith(b"\0AUTH"), "somebody speaks to the bus")
+            # A queue for "utility" work, which the unit lets lower its own priority.
+            tasks = pathlib.Path(f"/proc/{property_of(SERVICE, 'MainPID')}/task").iterdir()
+            niceness = [int((task / "stat").read_text().rpartition(")")[2].split()[16]) for task in tasks
+                        if (task / "comm").read_text() == "RadioManagerLog\n"]
+            expect_equal(niceness, [10])
     os.unlink("/run/dbus/system_bus_socket")
 
 

@@ -79,9 +79,10 @@ int numberIn(const char* variable) noexcept {
 // Once: the variables are gone afterwards, for programs that are started from here.
 ListenDescriptors takeListenDescriptors() {
   ListenDescriptors given;
-  if (numberIn("LISTEN_PID") != ::getpid()) return given;
-  given.count = std::max(numberIn("LISTEN_FDS"), 0);
-  if (const char* const names = std::getenv("LISTEN_FDNAMES")) given.names = names;
+  if (numberIn("LISTEN_PID") == ::getpid()) {
+    given.count = std::max(numberIn("LISTEN_FDS"), 0);
+    if (const char* const names = std::getenv("LISTEN_FDNAMES")) given.names = names;
+  }
   for (const char* const variable : {"LISTEN_PID", "LISTEN_FDS", "LISTEN_FDNAMES"}) ::unsetenv(variable);
   return given;
 }

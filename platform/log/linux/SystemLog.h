@@ -3,13 +3,13 @@
 #pragma once
 
 #include "platform/log/Log.h"
+#include "platform/log/linux/Journal.h"
 
 namespace brenvik {
 
-// The unified log on the systemd journal (sd_journal_send(3)), or on standard error with the <N> priority
-// prefix of sd-daemon(3) while there is no journal socket; the BSD log on syslog(3), facility daemon. Lines
-// are escaped: a control character or a byte that is not UTF-8 is written as \xNN, one trailing newline of a
-// BSD line is dropped. Any thread.
+// The unified log on the journal (Journal.h), or on standard error with the <N> priority prefix of
+// sd-daemon(3) while there is none; the BSD log on syslog(3), facility daemon. Lines are escaped
+// (EscapedLine.h), one trailing newline of a BSD line is dropped. Any thread.
 //
 // Every journal entry has the MESSAGE_ID of its text. syslog(3) cannot carry one: where /dev/log is the
 // journal's own socket, the BSD log's lines are handed to it natively, with the same identifier, priority and
@@ -28,6 +28,7 @@ class SystemLog final : public LogSink {
 
  private:
   const char* const identifier_;
+  Journal journal_;
 };
 
 }  // namespace brenvik

@@ -2,28 +2,28 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/radio/linux/ModemManagerLogs.h"
 
-#include <systemd/sd-bus.h>
-
 #include <atomic>
 #include <chrono>
 #include <exception>
 #include <utility>
+
+#include "platform/radio/linux/SdBus.h"
 
 namespace brenvik {
 namespace {
 
 using Clock = std::chrono::steady_clock;
 
-struct BusCloser {
-  // Without the flush that sd-bus offers: that could wait for a bus that does not read.
-  void operator()(sd_bus* bus) const noexcept { sd_bus_close_unref(bus); }
+// Owners of what sd-bus makes. A bus is closed without the flush that sd-bus offers: that could wait for a
+// bus that does not read.
+struct Unref {
+  const SdBus& functions;
+  void operator()(sd_bus* bus) const noexcept { functions.closeUnref(bus); }
+  void operator()(sd_bus_message* message) const noexcept { functions.unrefMessage(message); }
+  void operator()(sd_bus_slot* slot) const noexcept { functions.unrefSlot(slot); }
 };
-struct MessageUnref {
-  void operator()(sd_bus_message* message) const noexcept { sd_bus_message_unref(message); }
-};
-struct SlotUnref {
-  void operator()(sd_bus_slot* slot) const noexcept { sd_bus_slot_unref(slot); }
-};
+template <typename Object>
+using Owned = std::unique_ptr<Object, Unref>;
 
 std::uint64_t microsecondsUntil(Clock::time_point deadline) noexcept {
   const auto left = std::chrono::duration_cast<std::chrono::microseconds>(deadline - Clock::now());
@@ -36,34 +36,35 @@ int takeAnswer(sd_bus_message*, void* answered, sd_bus_error*) {
 }
 
 // A bus that is absent, refuses or keeps silent changes nothing for anybody, so every failure just ends it.
-void setLogging(const char* busAddress, const char* level, std::chrono::milliseconds patience) noexcept {
+void setLogging(SdBus& sd, const char* busAddress, const char* level,
+                std::chrono::milliseconds patience) noexcept {
   const auto deadline = Clock::now() + patience;
+  if (!sd.load()) return;
   sd_bus* opened = nullptr;
-  if (sd_bus_new(&opened) < 0) return;
-  const std::unique_ptr<sd_bus, BusCloser> bus(opened);
-  if (sd_bus_set_address(opened, busAddress) < 0 || sd_bus_set_bus_client(opened, 1) < 0) return;
-  if (sd_bus_start(opened) < 0) return;
+  if (sd.create(&opened) < 0) return;
+  const Owned<sd_bus> bus(opened, {sd});
+  if (sd.setAddress(opened, busAddress) < 0 || sd.setBusClient(opened, 1) < 0) return;
+  if (sd.start(opened) < 0) return;
 
   sd_bus_message* made = nullptr;
-  if (sd_bus_message_new_method_call(opened, &made, "org.freedesktop.ModemManager1",
-                                     "/org/freedesktop/ModemManager1", "org.freedesktop.ModemManager1",
-                                     "SetLogging") < 0) {
+  if (sd.newMethodCall(opened, &made, "org.freedesktop.ModemManager1", "/org/freedesktop/ModemManager1",
+                       "org.freedesktop.ModemManager1", "SetLogging") < 0) {
     return;
   }
-  const std::unique_ptr<sd_bus_message, MessageUnref> call(made);
-  if (sd_bus_message_append(made, "s", level) < 0 || sd_bus_message_set_auto_start(made, 0) < 0) return;
+  const Owned<sd_bus_message> call(made, {sd});
+  if (sd.append(made, "s", level) < 0 || sd.setAutoStart(made, 0) < 0) return;
 
   bool answered = false;
   sd_bus_slot* asked = nullptr;
-  if (sd_bus_call_async(opened, &asked, made, takeAnswer, &answered, microsecondsUntil(deadline)) < 0) return;
-  const std::unique_ptr<sd_bus_slot, SlotUnref> slot(asked);
+  if (sd.callAsync(opened, &asked, made, takeAnswer, &answered, microsecondsUntil(deadline)) < 0) return;
+  const Owned<sd_bus_slot> slot(asked, {sd});
   // The answer is waited for although it changes nothing: a sender that hangs up at once may not be heard.
   while (!answered) {
-    const int handled = sd_bus_process(opened, nullptr);
+    const int handled = sd.process(opened, nullptr);
     if (handled < 0) return;
     if (handled > 0) continue;
     const std::uint64_t left = microsecondsUntil(deadline);
-    if (left == 0 || sd_bus_wait(opened, left) < 0) return;
+    if (left == 0 || sd.wait(opened, left) < 0) return;
   }
 }
 
@@ -73,12 +74,13 @@ struct ModemManagerLogs::Switch {
   enum Position : int { unchanged, off, on };
   const std::string busAddress;
   const std::chrono::milliseconds patience;
+  SdBus bus;  // of the queue alone
   std::atomic<Position> wanted{unchanged};
 };
 
 ModemManagerLogs::ModemManagerLogs(WorkQueues& queues, std::string busAddress,
-                                   std::chrono::milliseconds patience)
-    : queues_(queues), switch_(new Switch{std::move(busAddress), patience}) {}
+                                   std::chrono::milliseconds patience, const char* library)
+    : queues_(queues), switch_(new Switch{std::move(busAddress), patience, SdBus(library)}) {}
 
 ModemManagerLogs::~ModemManagerLogs() = default;
 
@@ -90,7 +92,8 @@ void ModemManagerLogs::setLogToFile(bool enable) noexcept {
     queue_->post([state = switch_] {
       const auto wanted = state->wanted.exchange(Switch::unchanged);
       if (wanted == Switch::unchanged) return;
-      setLogging(state->busAddress.c_str(), wanted == Switch::on ? "DEBUG" : "INFO", state->patience);
+      setLogging(state->bus, state->busAddress.c_str(), wanted == Switch::on ? "DEBUG" : "INFO",
+                 state->patience);
     });
   } catch (const std::exception&) {
     switch_->wanted = Switch::unchanged;  // no memory or no thread: the next switch tries again

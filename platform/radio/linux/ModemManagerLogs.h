@@ -17,10 +17,10 @@ namespace brenvik {
 // while that lasts is remembered, the last position only. Main loop only.
 class ModemManagerLogs final : public RadioManager {
  public:
-  // The bus is the system bus and the patience kPatience unless a test brings its own. `queues` must outlive
-  // this object.
+  // The bus is the system bus, the patience kPatience and the library that of sd-bus unless a test brings its
+  // own. `queues` must outlive this object.
   explicit ModemManagerLogs(WorkQueues& queues, std::string busAddress = kSystemBus,
-                            std::chrono::milliseconds patience = kPatience);
+                            std::chrono::milliseconds patience = kPatience, const char* library = kLibrary);
   ModemManagerLogs(const ModemManagerLogs&) = delete;
   ModemManagerLogs& operator=(const ModemManagerLogs&) = delete;
   // Waits for a call under way: up to one second.
@@ -30,6 +30,8 @@ class ModemManagerLogs final : public RadioManager {
 
   // Fixed, so that nothing in the environment can point the helper elsewhere.
   static constexpr const char* kSystemBus = "unix:path=/run/dbus/system_bus_socket";
+  // Loaded with the first switch, on the queue.
+  static constexpr const char* kLibrary = "libsystemd.so.0";
   // For everything that one switch does: connecting, authenticating, the call and its answer.
   static constexpr std::chrono::milliseconds kPatience{1000};
 

@@ -285,6 +285,41 @@ TEST_F(ModemManagerLogsTest, ABusThatAcceptsAndSaysNothingIsGivenUpWhenThePatien
   EXPECT_LT(took, kAtMost);
 }
 
+// Where the loader has found a library, of which this process says so itself (proc(5)).
+std::string placeOf(const std::string& library) {
+  std::ifstream maps("/proc/self/maps");
+  for (std::string line; std::getline(maps, line);) {
+    if (line.find(library) != std::string::npos) return line.substr(line.find('/'));
+  }
+  return "";
+}
+
+TEST_F(ModemManagerLogsTest, WithoutTheLibraryOrWithAnotherOneNothingHappens) {
+  PrivateBus bus(folder);
+  ASSERT_TRUE(bus.isUp());
+  StandinModemManager manager(bus.address(), Manners::answers);
+  for (const std::string& library : {(folder / "missing.so").string(), placeOf("libc.so.6")}) {
+    ModemManagerLogs logs(queues, bus.address(), kPlenty, library.c_str());
+    logs.setLogToFile(true);
+    EXPECT_LT(runQueue(), kAtMost);
+  }
+  EXPECT_THAT(manager.calls(), IsEmpty());
+}
+
+TEST_F(ModemManagerLogsTest, ALibraryThatCouldNotBeLoadedIsLookedForAgain) {
+  PrivateBus bus(folder);
+  ASSERT_TRUE(bus.isUp());
+  StandinModemManager manager(bus.address(), Manners::answers);
+  const std::string library = (folder / "late.so").string();
+  ModemManagerLogs logs(queues, bus.address(), kPlenty, library.c_str());
+  logs.setLogToFile(true);
+  runQueue();
+  std::filesystem::create_symlink(placeOf("libsystemd.so.0"), library);
+  logs.setLogToFile(true);
+  runQueue();
+  EXPECT_THAT(manager.calls(), ElementsAre("DEBUG"));
+}
+
 TEST_F(ModemManagerLogsTest, AnAddressThatIsNoneIsNoBus) {
   ModemManagerLogs logs(queues, "", kPlenty);
   logs.setLogToFile(true);

@@ -5,11 +5,11 @@
 #include <sched.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
+#include <sys/timerfd.h>
 #include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <climits>
 #include <new>
@@ -23,11 +23,13 @@ namespace {
 // Counts while the system sleeps, as a person's idea of "ten seconds later" does.
 constexpr clockid_t kClock = CLOCK_BOOTTIME;
 
-std::uint64_t nowMicroseconds() noexcept {
+constexpr std::uint64_t kNanosecondsASecond = 1'000'000'000;
+
+std::uint64_t nowNanoseconds() noexcept {
   timespec now{};
   ::clock_gettime(kClock, &now);
-  return static_cast<std::uint64_t>(now.tv_sec) * 1'000'000U +
-         static_cast<std::uint64_t>(now.tv_nsec) / 1'000U;
+  return static_cast<std::uint64_t>(now.tv_sec) * kNanosecondsASecond +
+         static_cast<std::uint64_t>(now.tv_nsec);
 }
 
 // Rounded up, so that nobody waits in a circle for the last fraction; the longest that can be said else.
@@ -37,9 +39,8 @@ int toMilliseconds(std::uint64_t microseconds) noexcept {
       std::min<std::uint64_t>(microseconds / 1'000U + (microseconds % 1'000U != 0), INT_MAX));
 }
 
-// Rounded up, so that nothing fires early.
-std::uint64_t toMicroseconds(std::chrono::nanoseconds time) noexcept {
-  return time.count() <= 0 ? 0 : (static_cast<std::uint64_t>(time.count()) + 999U) / 1'000U;
+std::uint64_t count(std::chrono::nanoseconds time) noexcept {
+  return time.count() <= 0 ? 0 : static_cast<std::uint64_t>(time.count());
 }
 
 // Runs what a task or a source brought along. One that lacks memory and has not coped with that itself is
@@ -55,15 +56,12 @@ void run(const Work& work) noexcept {
 
 }  // namespace
 
-struct EventLoop::Timer {
-  std::uint64_t next = 0;      // microseconds of kClock
-  std::uint64_t interval = 0;  // microseconds; 0: once
-  std::uint64_t leeway = 1;
+struct EventLoop::Timer : TimerHeapItem {
+  std::uint64_t interval = 0;  // nanoseconds; 0: once
   std::function<void()> handler;
   std::function<void()> failed;
   std::atomic<bool> valid{true};
   EventLoop* loop = nullptr;
-  SourcePointer source;  // loop thread only
 };
 
 class EventLoop::TimerHandle final : public LoopSource {
@@ -94,6 +92,8 @@ class EventLoop::DescriptorSet {
   struct Entry {
     int fd;
     RunLoop::DescriptorHandler handler;
+    int running = 0;  // how many calls of the handler have not returned: it may run the loop
+    bool isRetired = false;
   };
 
   bool make() noexcept {
@@ -111,20 +111,19 @@ class EventLoop::DescriptorSet {
     return count < 0 ? -errno : count;
   }
   void handle(Entry* entry, std::uint32_t events) noexcept {
-    handling_ = entry;
+    ++entry->running;
     run([entry, events] { entry->handler(events); });
-    handling_ = nullptr;
-    gone_.reset();
+    if (--entry->running == 0 && entry->isRetired) delete entry;
   }
   // An entry whose handler runs lives until that returns.
   void retire(std::unique_ptr<Entry> entry) noexcept {
-    if (entry.get() == handling_) gone_ = std::move(entry);
+    if (entry->running == 0) return;
+    entry->isRetired = true;
+    (void)entry.release();
   }
 
  private:
   UniqueFd epoll_;
-  Entry* handling_ = nullptr;
-  std::unique_ptr<Entry> gone_;
 };
 
 class EventLoop::Descriptor final : public DescriptorSource {
@@ -165,38 +164,16 @@ std::shared_ptr<EventLoop> EventLoop::make(For whom) try {
     raw->drainInbox();
   });
   if (loop->wakeSource_ == nullptr) return nullptr;
-  if (whom == For::anotherThread) {
-    // The library opens a clock's descriptor for its first timer and keeps it: later might be too late.
-    sd_event_source* source = nullptr;
-    if (!loop->makeTimers() || sd_event_add_time(loop->timers_.get(), &source, kClock, UINT64_MAX, 1,
-                                                 &EventLoop::onTime, nullptr) < 0) {
-      return nullptr;
-    }
-    sd_event_source_disable_unref(source);
-  }
+  loop->clockFd_.reset(::timerfd_create(kClock, TFD_CLOEXEC | TFD_NONBLOCK));
+  if (!loop->clockFd_.isValid()) return nullptr;
+  loop->clockSource_ = loop->addDescriptor(loop->clockFd_.get(), EPOLLIN, [](std::uint32_t) {});
+  if (loop->clockSource_ == nullptr) return nullptr;
   return loop;
 } catch (const std::bad_alloc&) {
   return nullptr;
 }
 
-EventLoop::~EventLoop() {
-  // A timer's source holds a reference to the loop's event object.
-  for (auto& [raw, timer] : armed_) timer->source.reset();
-}
-
-bool EventLoop::makeTimers() noexcept {
-  if (timers_ != nullptr) return true;
-  sd_event* event = nullptr;
-  if (sd_event_new(&event) < 0) return false;
-  std::unique_ptr<sd_event, Unref> timers(event);
-  try {
-    timersSource_ = addDescriptor(sd_event_get_fd(event), EPOLLIN, [](std::uint32_t) {});
-  } catch (const std::bad_alloc&) {
-  }
-  if (timersSource_ == nullptr) return false;
-  timers_ = std::move(timers);
-  return true;
-}
+EventLoop::~EventLoop() = default;
 
 bool EventLoop::onLoopThread() const noexcept {
   return thread_.load(std::memory_order_relaxed) == std::this_thread::get_id();
@@ -204,64 +181,72 @@ bool EventLoop::onLoopThread() const noexcept {
 
 int EventLoop::runOnce(std::uint64_t timeOut) noexcept {
   thread_.store(std::this_thread::get_id(), std::memory_order_relaxed);
+  const auto* const clock = static_cast<const Descriptor*>(clockSource_.get())->entry();
   for (;;) {
-    if (timers_ != nullptr && (!timersPrepared_ || timersChanged_)) {
-      // One that is prepared takes no notice of a change before it has waited, too.
-      if (timersPrepared_ && handleTimer() > 0) return 1;
-      timersChanged_ = false;
-      const int due = sd_event_prepare(timers_.get());
-      if (due < 0) return due;
-      if (due > 0) {
-        (void)sd_event_dispatch(timers_.get());
-        return 1;
-      }
-      timersPrepared_ = true;
-    }
+    setClock();
     // One at a time: what is ready and not handled now goes to the end of the kernel's queue, and a handler
     // may end the watching of any other.
     epoll_event ready{};
     int count = 0;
     if (!std::exchange(ownTasksAreNext_, false) || !hasOwnTasks_) {
-      count = descriptors_->wait(&ready, 1, hasOwnTasks_ ? 0 : toMilliseconds(timeOut));
-      if (count == -EINTR) continue;
+      count = descriptors_->wait(&ready, 1, hasOwnTasks_ || clockWasSeenDue_ ? 0 : toMilliseconds(timeOut));
+      if (count == -EINTR) return 0;
       if (count < 0) return count;
-      ownTasksAreNext_ = hasOwnTasks_ && count > 0;
     }
     if (count == 0) {
-      if (!hasOwnTasks_) return 0;
+      // The clock's descriptor may tell a moment later than the clock.
+      if (!hasOwnTasks_) return handleTimer() ? 1 : 0;
       // Whoever has just got a reply goes first where there is one processor: it waited for that, not for
       // this.
       (void)::sched_yield();
       drainInbox();
       return 1;
     }
-    const auto isTimers = [this](const epoll_event& event) {
-      return timersSource_ != nullptr &&
-             event.data.ptr == static_cast<const Descriptor*>(timersSource_.get())->entry();
-    };
-    if (isTimers(ready)) {
+    if (ready.data.ptr == clock) {
       // A descriptor that is ready at the same moment goes first: a check-in that has arrived beats the idle
-      // countdown.
-      std::array<epoll_event, 2> both{};
-      count = descriptors_->wait(both.data(), static_cast<int>(both.size()), 0);
-      const auto other = std::find_if_not(both.begin(), both.begin() + std::max(count, 0), isTimers);
-      if (other == both.begin() + std::max(count, 0)) {
-        if (handleTimer() > 0) return 1;
-        continue;
-      }
-      ready = *other;
+      // countdown. They are all ahead of the clock in the kernel's queue, which has put it at the end: when
+      // it comes round, each has had its turn.
+      if (!std::exchange(clockWasSeenDue_, true)) continue;
+      if (!handleTimer()) continue;
+    } else {
+      descriptors_->handle(static_cast<DescriptorSet::Entry*>(ready.data.ptr), ready.events);
     }
-    descriptors_->handle(static_cast<DescriptorSet::Entry*>(ready.data.ptr), ready.events);
+    ownTasksAreNext_ = hasOwnTasks_;
     return 1;
   }
 }
 
-// Handles the timer that is due, if one is: 1.
-int EventLoop::handleTimer() noexcept {
-  timersPrepared_ = false;
-  if (sd_event_wait(timers_.get(), 0) <= 0) return 0;
-  (void)sd_event_dispatch(timers_.get());
-  return 1;
+// Sets the timerfd to the first timer. It is not read: being set makes it unreadable, too.
+void EventLoop::setClock() noexcept {
+  const std::uint64_t wakeUp = timers_.wakeUp();
+  if (wakeUp == clockIsSetTo_) return;
+  itimerspec time{};  // of zeros: never
+  if (wakeUp != UINT64_MAX) {
+    const std::uint64_t due = std::max<std::uint64_t>(wakeUp, 1);
+    time.it_value.tv_sec = static_cast<time_t>(due / kNanosecondsASecond);
+    time.it_value.tv_nsec = static_cast<long>(due % kNanosecondsASecond);
+  }
+  (void)::timerfd_settime(clockFd_.get(), TFD_TIMER_ABSTIME, &time, nullptr);
+  clockIsSetTo_ = wakeUp;
+  clockWasSeenDue_ = false;
+}
+
+// Handles the timer that is due, if one is.
+bool EventLoop::handleTimer() noexcept {
+  clockWasSeenDue_ = false;
+  const std::uint64_t now = nowNanoseconds();
+  if (timers_.isEmpty() || timers_.first()->next > now) return false;
+  const std::shared_ptr<Timer> timer = timers_.first();  // outlives a handler that cancels itself
+  if (!timer->valid.load() || timer->interval == 0) {
+    timers_.remove(*timer);
+  } else {
+    // Ticks that were missed are dropped; the rhythm stays.
+    std::uint64_t next = timer->next + timer->interval;
+    if (next <= now) next += ((now - next) / timer->interval + 1) * timer->interval;
+    timers_.move(*timer, next);
+  }
+  if (timer->valid.load()) run(timer->handler);
+  return true;
 }
 
 void EventLoop::wake() noexcept {
@@ -304,50 +289,16 @@ std::unique_ptr<DescriptorSource> EventLoop::addDescriptor(int fd, std::uint32_t
   return descriptor;
 }
 
-int EventLoop::onTime(sd_event_source* source, std::uint64_t, void* userdata) noexcept {
-  auto* const raw = static_cast<Timer*>(userdata);
-  const std::shared_ptr<Timer> timer = raw->loop->armed_.at(raw);  // outlives a handler that cancels itself
-  if (!timer->valid.load()) {
-    timer->loop->disarm(*timer);
-    return 0;
-  }
-  if (timer->interval > 0) {
-    // Ticks that were missed are dropped; the rhythm stays.
-    const std::uint64_t now = nowMicroseconds();
-    timer->next += timer->interval;
-    if (timer->next <= now) timer->next += ((now - timer->next) / timer->interval + 1) * timer->interval;
-    sd_event_source_set_time(source, timer->next);
-    sd_event_source_set_enabled(source, SD_EVENT_ONESHOT);
-  } else {
-    timer->loop->disarm(*timer);
-  }
-  run(timer->handler);
-  return 0;
-}
-
 bool EventLoop::arm(const std::shared_ptr<Timer>& timer) noexcept {
-  sd_event_source* source = nullptr;
-  if (!makeTimers()) return false;
-  timersChanged_ = true;
-  if (sd_event_add_time(timers_.get(), &source, kClock, timer->next, timer->leeway, &EventLoop::onTime,
-                        timer.get()) < 0) {
-    return false;
-  }
-  timer->source.reset(source);
   try {
-    armed_.emplace(timer.get(), timer);
+    timers_.add(timer);
     return true;
   } catch (const std::bad_alloc&) {
-    timer->source.reset();
     return false;
   }
 }
 
-void EventLoop::disarm(Timer& timer) noexcept {
-  timersChanged_ = true;
-  timer.source.reset();
-  armed_.erase(&timer);
-}
+void EventLoop::disarm(Timer& timer) noexcept { timers_.remove(timer); }
 
 std::unique_ptr<LoopSource> EventLoop::addTimer(std::chrono::nanoseconds first,
                                                 std::chrono::nanoseconds interval,
@@ -355,10 +306,9 @@ std::unique_ptr<LoopSource> EventLoop::addTimer(std::chrono::nanoseconds first,
                                                 std::function<void()> handler, std::function<void()> failed) {
   auto timer = std::make_shared<Timer>();
   timer->loop = this;
-  timer->next = nowMicroseconds() + toMicroseconds(first);
-  timer->interval = toMicroseconds(interval);
-  // 0 would mean the library's quarter of a second.
-  timer->leeway = std::max<std::uint64_t>(toMicroseconds(leeway), 1);
+  timer->next = nowNanoseconds() + count(first);
+  timer->interval = count(interval);
+  timer->leeway = count(leeway);
   timer->handler = std::move(handler);
   timer->failed = std::move(failed);
   // First: a timer that runs is one that somebody can end.
@@ -376,7 +326,7 @@ std::unique_ptr<LoopSource> EventLoop::addTimer(std::chrono::nanoseconds first,
 void EventLoop::postAfter(std::chrono::nanoseconds delay, std::function<void()> task) {
   auto timer = std::make_shared<Timer>();
   timer->loop = this;
-  timer->next = nowMicroseconds() + toMicroseconds(delay);
+  timer->next = nowNanoseconds() + count(delay);
   timer->handler = std::move(task);
   const auto armOrRun = [timer] {
     if (!timer->loop->arm(timer)) timer->handler();

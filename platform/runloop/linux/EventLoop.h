@@ -2,34 +2,32 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
-#include <systemd/sd-event.h>
-
 #include <atomic>
 #include <chrono>
 #include <functional>
 #include <memory>
 #include <mutex>
 #include <thread>
-#include <unordered_map>
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
 #include "platform/runloop/RunLoop.h"
+#include "platform/runloop/linux/TimerHeap.h"
 
 namespace brenvik {
 
 // One thread's loop with an inbox that any thread may post to; what the main run loop and every work queue
-// stand on. It wakes for its sources and its inbox and for nothing else. Timers are an sd_event(3) of its
-// own; descriptors are in an epoll(7) set in which that one is, too, because going through sd_event costs a
-// request 0.08 times the whole of a bare one.
+// stand on. It wakes for its sources and its inbox and for nothing else. All of them are in one epoll(7) set:
+// the watched descriptors, an eventfd for the inbox and one timerfd for all timers, which is set to the first
+// of them before the loop waits.
 //
 // The thread that calls runOnce() is the loop's thread.
 class EventLoop : public std::enable_shared_from_this<EventLoop> {
  public:
-  // Whose the loop is before its first runOnce(): the maker's own, or another's that will be started. One for
-  // another thread takes all the descriptors it will ever need at once, timers included.
+  // Which thread owns the loop before its first runOnce(): the one that makes it, or one to be started.
   enum class For { thisThread, anotherThread };
-  static constexpr int kDescriptorsForAnotherThread = 4;
+  // What a loop needs for itself; it takes all of them when it is made.
+  static constexpr int kDescriptors = 3;
 
   // Null when the system is out of descriptors or memory.
   static std::shared_ptr<EventLoop> make(For whom);
@@ -37,9 +35,9 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   EventLoop(const EventLoop&) = delete;
   EventLoop& operator=(const EventLoop&) = delete;
 
-  // Waits for one source and handles it: 1 when one was handled, 0 when the time passed, negative errno.
-  // Ready descriptors come before due timers, and each other in turn. `timeOut` in microseconds; UINT64_MAX:
-  // none.
+  // Waits for one source and handles it: 1 when one was handled, 0 when the time passed or a signal came,
+  // negative errno. Ready descriptors take turns. A timer that is due comes after the descriptors that are
+  // ready at the same moment, and before their next turn. `timeOut` in microseconds; UINT64_MAX: none.
   int runOnce(std::uint64_t timeOut) noexcept;
 
   // Any thread. May throw std::bad_alloc; a task that throws it is given up, with a line in the log.
@@ -71,27 +69,21 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
 
   EventLoop() = default;
   void drainInbox() noexcept;
-  bool makeTimers() noexcept;
-  int handleTimer() noexcept;
+  void setClock() noexcept;
+  bool handleTimer() noexcept;
   bool arm(const std::shared_ptr<Timer>& timer) noexcept;
   void disarm(Timer& timer) noexcept;
-  static int onTime(sd_event_source* source, std::uint64_t due, void* userdata) noexcept;
-
-  struct Unref {
-    void operator()(sd_event* event) const noexcept { sd_event_unref(event); }
-    void operator()(sd_event_source* source) const noexcept { sd_event_source_disable_unref(source); }
-  };
-  using SourcePointer = std::unique_ptr<sd_event_source, Unref>;
 
   std::shared_ptr<DescriptorSet> descriptors_;
   UniqueFd wakeFd_;
   std::unique_ptr<DescriptorSource> wakeSource_;
-  // Loop thread only: made with the first timer; whether sd_event_prepare(3) has been called since the last
-  // dispatch, and whether a timer has changed since then.
-  std::unique_ptr<sd_event, Unref> timers_;
-  std::unique_ptr<DescriptorSource> timersSource_;
-  bool timersPrepared_ = false;
-  bool timersChanged_ = false;
+  UniqueFd clockFd_;
+  std::unique_ptr<DescriptorSource> clockSource_;
+  // Loop thread only: the timers that run; what the timerfd is set to; and whether it has been seen to be
+  // due, so that it is the timers' turn when it comes round again.
+  TimerHeap<Timer> timers_;
+  std::uint64_t clockIsSetTo_ = UINT64_MAX;
+  bool clockWasSeenDue_ = false;
   // Loop thread only: the inbox holds what the thread has posted to itself, which takes no wake-up; and it is
   // that inbox's turn, after a descriptor had its own.
   bool hasOwnTasks_ = false;
@@ -99,7 +91,6 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   std::atomic<std::thread::id> thread_;  // none: not started
   std::mutex inboxMutex_;
   std::vector<std::function<void()>> inbox_;
-  std::unordered_map<Timer*, std::shared_ptr<Timer>> armed_;  // loop thread only
 };
 
 }  // namespace brenvik

@@ -12,7 +12,7 @@
 
 namespace brenvik {
 
-// The run loop of the thread that makes it, on sd-event.
+// The run loop of the thread that makes it, on epoll(7).
 class SystemRunLoop final : public RunLoop {
  public:
   // Null when the system is out of descriptors or memory.
@@ -40,7 +40,7 @@ class SystemRunLoop final : public RunLoop {
 class SystemQueues final : public WorkQueues {
  public:
   // What a process should leave between its soft limit and the hard one.
-  static constexpr unsigned kReservedDescriptors = 36;
+  static constexpr unsigned kReservedDescriptors = 27;
 
   // The run loop must outlive this object.
   explicit SystemQueues(SystemRunLoop& mainLoop);

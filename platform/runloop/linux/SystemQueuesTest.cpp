@@ -17,6 +17,7 @@
 
 #include <array>
 #include <filesystem>
+#include <fstream>
 #include <future>
 #include <limits>
 #include <new>
@@ -195,6 +196,109 @@ TEST_F(SystemQueuesTest, ATimerThatIsMadeOrCancelledWhileAnotherRunsDownIsHeeded
     EXPECT_EQ(order, "del");
     return;
   }
+}
+
+TEST_F(SystemQueuesTest, ATimerThatIsDueHasItsTurnBetweenDescriptorsThatAreAlwaysReady) {
+  const UniqueFd first(::eventfd(1, EFD_CLOEXEC));
+  const UniqueFd second(::eventfd(1, EFD_CLOEXEC));
+  int served = 0;
+  const auto a = loop->addDescriptor(first.get(), EPOLLIN, [&](std::uint32_t) { ++served; });
+  const auto b = loop->addDescriptor(second.get(), EPOLLIN, [&](std::uint32_t) { ++served; });
+  int ticks = 0;
+  const auto timer = loop->addTimer(0s, 1ns, [&] { ++ticks; }, {});
+  for (int i = 0; i < 3000; ++i) (void)loop->run(0s, ReturnAfterSource::yes);
+  EXPECT_EQ(ticks + served, 3000);
+  EXPECT_GT(ticks, 300);
+  EXPECT_GE(served, 2 * (ticks - 1)) << "each descriptor that was ready went first";
+}
+
+TEST_F(SystemQueuesTest, TimersOfOneMomentFireInTheOrderInWhichTheyWereMadeAndOneAtATime) {
+  std::vector<int> fired;
+  std::vector<std::unique_ptr<LoopSource>> timers;
+  constexpr int kTimers = 1000;
+  for (int i = 0; i < kTimers; ++i)
+    timers.push_back(loop->addTimer(0s, 0s, [&, i] { fired.push_back(i); }, {}));
+  for (std::size_t before = 0; before < kTimers; before = fired.size()) {
+    ASSERT_EQ(loop->run(20s, ReturnAfterSource::yes), RunResult::handledSource);
+    ASSERT_EQ(fired.size(), before + 1);
+  }
+  EXPECT_TRUE(std::is_sorted(fired.begin(), fired.end()));
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::no), RunResult::timedOut);
+}
+
+TEST_F(SystemQueuesTest, AHandlerMayCancelTimersThatAreDueAtTheSameMomentAndMakeNewOnes) {
+  std::string order;
+  std::vector<std::unique_ptr<LoopSource>> timers;
+  timers.push_back(loop->addTimer(0s, 0s,
+                                  [&] {
+                                    order += '1';
+                                    timers.clear();  // this one, too, while its handler runs
+                                    timers.push_back(loop->addTimer(0s, 0s, [&] { order += '4'; }, {}));
+                                  },
+                                  {}));
+  timers.push_back(loop->addTimer(0s, 0s, [&] { order += '2'; }, {}));
+  timers.push_back(loop->addTimer(0s, 1ns, [&] { order += '3'; }, {}));
+  runUntil([&] { return order.size() == 2; });
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::no), RunResult::timedOut);
+  EXPECT_EQ(order, "14");
+}
+
+TEST_F(SystemQueuesTest, TicksThatWereMissedAreDroppedAndTheRhythmStays) {
+  using Clock = std::chrono::steady_clock;
+  constexpr auto kInterval = 20ms;
+  std::vector<Clock::time_point> ticks;
+  const auto start = Clock::now();
+  const auto timer = loop->addTimer(kInterval, kInterval, [&] { ticks.push_back(Clock::now()); }, {});
+  std::this_thread::sleep_until(start + 5 * kInterval);
+  runUntil([&] { return ticks.size() == 2; });
+  EXPECT_GE(ticks[0] - start, 5 * kInterval);
+  EXPECT_GE(ticks[1] - start, 6 * kInterval) << "the five that were missed are one";
+}
+
+TEST_F(SystemQueuesTest, ATimerFarBeyondAnyClockIsMadeAndNeverFires) {
+  const auto timer = loop->addTimer(std::chrono::nanoseconds::max(), std::chrono::nanoseconds::max(),
+                                    [] { ADD_FAILURE() << "fired"; }, {});
+  EXPECT_NE(timer, nullptr);
+  EXPECT_EQ(loop->run(1ms, ReturnAfterSource::no), RunResult::timedOut);
+}
+
+TEST_F(SystemQueuesTest, ATimerThatIsDueFiresAlsoInARunThatMayNotWait) {
+  bool fired = false;
+  const auto timer = loop->addTimer(0s, 0s, [&] { fired = true; }, {});
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::handledSource);
+  EXPECT_TRUE(fired);
+}
+
+TEST_F(SystemQueuesTest, TimersCountTheTimeThatTheSystemSleeps) {
+  // What the kernel says of the one clock that this process has (proc(5)).
+  std::vector<std::string> clocks;
+  for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fdinfo")) {
+    std::ifstream file(entry.path());
+    for (std::string line; std::getline(file, line);) {
+      if (line.starts_with("clockid:")) clocks.push_back(line);
+    }
+  }
+  EXPECT_EQ(clocks, std::vector<std::string>{"clockid: " + std::to_string(CLOCK_BOOTTIME)});
+}
+
+TEST_F(SystemQueuesTest, AHandlerThatRunsTheLoopMayLoseItsSourceMeanwhile) {
+  const UniqueFd first(::eventfd(1, EFD_CLOEXEC));
+  const UniqueFd second(::eventfd(1, EFD_CLOEXEC));
+  std::string order;
+  std::unique_ptr<DescriptorSource> a;
+  std::unique_ptr<DescriptorSource> b;
+  a = loop->addDescriptor(first.get(), EPOLLIN,
+                          [&, kept = std::make_shared<std::string>("a")](std::uint32_t) {
+                            b = loop->addDescriptor(second.get(), EPOLLIN, [&](std::uint32_t) {
+                              order += 'b';
+                              a.reset();
+                              b.reset();
+                            });
+                            while (b != nullptr) (void)loop->run(20s, ReturnAfterSource::yes);
+                            order += *kept;
+                          });
+  EXPECT_EQ(loop->run(20s, ReturnAfterSource::yes), RunResult::handledSource);
+  EXPECT_EQ(order.back(), 'a');
 }
 
 TEST_F(SystemQueuesTest, TimerOfAnotherThreadFiresOnTheLoopAndCanBeCancelledThere) {
@@ -403,8 +507,18 @@ class NoDescriptors {
   std::vector<UniqueFd> taken_;
 };
 
-constexpr std::size_t kReservedQueues =
-    SystemQueues::kReservedDescriptors / EventLoop::kDescriptorsForAnotherThread;
+// Runs a task on the queue and one that is delayed; whether both ran on a thread that is not this one.
+bool works(WorkQueue& queue) {
+  std::promise<bool> done;
+  queue.post([&] {
+    queue.postAfter(1ms, [&, on = std::this_thread::get_id()] {
+      done.set_value(on == std::this_thread::get_id() && queue.isCurrent());
+    });
+  });
+  return done.get_future().get() && !queue.isCurrent();
+}
+
+constexpr std::size_t kReservedQueues = SystemQueues::kReservedDescriptors / EventLoop::kDescriptors;
 
 TEST_F(SystemQueuesTest, WithoutDescriptorsQueuesLiveOnTheReserveAndGetThreadsOfTheirOwn) {
   SystemQueues queues(*loop);
