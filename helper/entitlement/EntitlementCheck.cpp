@@ -21,7 +21,7 @@ struct Grant {
 struct EntitlementCheck::State {
   struct Containers {
     std::multimap<pid_t, Grant> grants;
-    std::map<pid_t, std::unique_ptr<ProcessExitSource>> watchers;
+    std::map<pid_t, std::shared_ptr<ProcessExitSource>> watchers;
   };
 
   // The process has exited. Runs as the watcher's own handler, and ends that watcher.
@@ -75,21 +75,36 @@ bool EntitlementCheck::HasEntitlement(std::string_view name, const AuditToken& c
 
 void EntitlementCheck::remember(std::string_view name, const AuditToken& caller) {
   const pid_t pid = caller.pid();
-  const std::lock_guard lock(state_->mutex);
-  if (!state_->containers) return;
-  if (!state_->containers->grants.contains(pid)) {
-    // No cancel handler: the source has one owner, and goes with its entry.
-    auto source = queues_.makeProcessExitSource(pid, caller.pidVersion(),
-                                                [weak = std::weak_ptr<State>(state_), pid] {
-                                                  if (const auto state = weak.lock()) state->evict(pid);
-                                                },
-                                                {});
-    if (source != nullptr) {
-      source->activate();
-      state_->containers->watchers.insert_or_assign(pid, std::move(source));
+  std::shared_ptr<ProcessExitSource> source;
+  {
+    const std::lock_guard lock(state_->mutex);
+    if (!state_->containers) return;
+    auto& [grants, watchers] = *state_->containers;
+    if (!grants.contains(pid)) {
+      // No cancel handler: the source goes with its entry.
+      source = queues_.makeProcessExitSource(pid, caller.pidVersion(),
+                                             [weak = std::weak_ptr<State>(state_), pid] {
+                                               if (const auto state = weak.lock()) state->evict(pid);
+                                             },
+                                             {});
+    }
+    const auto grant = grants.emplace(pid, Grant{std::string(name), caller.pidVersion()});
+    try {
+      if (source != nullptr) watchers.insert_or_assign(pid, source);
+    } catch (...) {
+      grants.erase(grant);
+      throw;
     }
   }
-  state_->containers->grants.emplace(pid, Grant{std::string(name), caller.pidVersion()});
+  if (source == nullptr) return;
+  // Without the lock: a process that has exited by now is told of at once, and where the telling cannot be
+  // posted it happens within this very call. Evicted or torn down meanwhile, the source is cancelled, and
+  // this does nothing.
+  try {
+    source->activate();
+  } catch (...) {
+    state_->evict(pid);  // nobody would tell of its exit
+  }
 }
 
 void EntitlementCheck::tearDown() noexcept {

@@ -238,6 +238,68 @@ TEST_F(EntitlementCheckTest, WithoutMemoryToRememberItACallerIsGrantedAllTheSame
   EXPECT_FALSE(forgetful.HasEntitlement(kName, caller));
 }
 
+// Watchers of processes that have exited already, where nothing can be posted any more: the exit is told
+// within activate(), or activate() itself finds no memory. Nothing else is used.
+class ExitsAtOnce final : public WorkQueues {
+ public:
+  enum class Activation { tells, throws };
+  explicit ExitsAtOnce(Activation activation) : activation_(activation) {}
+  WorkQueue& main() noexcept override { std::abort(); }
+  WorkQueue& global() noexcept override { std::abort(); }
+  std::shared_ptr<WorkQueue> makeSerial(std::string, QualityOfService) override { std::abort(); }
+  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t, std::uint32_t, WorkQueue::Task onExit,
+                                                           WorkQueue::Task) override {
+    return std::make_unique<Source>(activation_, std::move(onExit));
+  }
+
+ private:
+  class Source final : public ProcessExitSource {
+   public:
+    Source(Activation activation, WorkQueue::Task onExit)
+        : activation_(activation), onExit_(std::move(onExit)) {}
+    void activate() override {
+      if (activation_ == Activation::throws) throw std::bad_alloc();
+      onExit_();
+    }
+    void cancel() noexcept override {}
+
+   private:
+    const Activation activation_;
+    const WorkQueue::Task onExit_;
+  };
+  const Activation activation_;
+};
+
+using EntitlementCheckDeathTest = EntitlementCheckTest;
+
+TEST_F(EntitlementCheckDeathTest, AnExitToldWithinTheActivationForgetsTheGrantAndBlocksNobody) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  security.grant(caller, kOther, PropertyList::boolean(true));
+  // In a process of its own, which an alarm ends if it blocks.
+  EXPECT_EXIT(
+      {
+        ::alarm(20);
+        ExitsAtOnce queuesThatFail(ExitsAtOnce::Activation::tells);
+        EntitlementCheck asked(security, queuesThatFail);
+        const bool first = asked.HasEntitlement(kName, caller);
+        const bool forgotten = asked.grants() == 0 && asked.watchers() == 0;
+        const bool second = asked.HasEntitlement(kOther, caller);
+        ::_exit(first && forgotten && second && asked.grants() == 0 ? 7 : 1);
+      },
+      testing::ExitedWithCode(7), "");
+}
+
+TEST_F(EntitlementCheckTest, AProcessWhoseWatcherCannotBeActivatedIsGrantedAndAskedForAgain) {
+  ExitsAtOnce queuesThatFail(ExitsAtOnce::Activation::throws);
+  EntitlementCheck forgetful(security, queuesThatFail);
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(forgetful.HasEntitlement(kName, caller));
+  EXPECT_EQ(forgetful.grants(), 0U);
+  EXPECT_EQ(forgetful.watchers(), 0U);
+  EXPECT_TRUE(forgetful.HasEntitlement(kName, caller));
+  EXPECT_EQ(security.questions(), 2);
+}
+
 TEST_F(EntitlementCheckTest, ATokenThatNamesNoProcessIsCheckedUnderMinusOne) {
   const AuditToken nobody = tokenOf(0);
   ASSERT_EQ(nobody.pid(), -1);
