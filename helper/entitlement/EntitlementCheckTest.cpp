@@ -17,6 +17,9 @@
 #include <vector>
 
 #include "platform/base/ProcessFacts.h"
+#include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
+#include "platform/log/fakes/RecordingLog.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/security/fakes/FakeTaskSecurity.h"
@@ -364,6 +367,61 @@ TEST_F(EntitlementCheckTest, AnExitHandledAfterTheCheckIsGoneFindsNothingToDo) {
   }
   EXPECT_EQ(queues.watchersOf(7), 0U);
   EXPECT_GE(queues.global().runReady(), 1);
+}
+
+TEST_F(EntitlementCheckTest, ARefusalIsToldWithTheCallerTheEntitlementAndTheReason) {
+  RecordingLog log;
+  const LogScope request("Routine", 3);
+  security.addProcess(caller);
+  security.refusal = "no file names it, says the fake";
+  EXPECT_FALSE(check.HasEntitlement(kName, caller));
+  EXPECT_EQ(log.entries(),
+            (std::vector{RecordingLog::unifiedLine(
+                LogLevel::standard,
+                "refused process 7: account 501, executable /usr/libexec/program, unit program.service: it "
+                "does not "
+                "hold com.norvale.Teravox.BrenvikHelper.allow: no file names it, says the fake")}));
+  EXPECT_EQ(log.fields(),
+            (std::vector<std::map<std::string, std::string>>{{{"BRENVIK_CALLER_PID", "7"},
+                                                              {"BRENVIK_CALLER_UID", "501"},
+                                                              {"BRENVIK_CALLER_EXE", "/usr/libexec/program"},
+                                                              {"BRENVIK_CALLER_UNIT", "program.service"},
+                                                              {"BRENVIK_ROUTINE", "Routine"}}}));
+  log.clear();
+  EXPECT_FALSE(check.HasEntitlement(kName, tokenOf(8)));
+  EXPECT_EQ(log.entries(),
+            (std::vector{RecordingLog::unifiedLine(
+                LogLevel::standard,
+                "refused process 8: account 501, executable not known, unit none: it does not hold "
+                "com.norvale.Teravox.BrenvikHelper.allow: the caller has ended")}));
+}
+
+TEST_F(EntitlementCheckTest, RefusalsThatHadNoLineAreToldAtTheTeardown) {
+  RecordingLog log;
+  security.addProcess(caller);
+  for (int i = 0; i < 3; ++i) EXPECT_FALSE(check.HasEntitlement(kName, caller));
+  EXPECT_EQ(security.explanations(), 1);
+  check.tearDown();
+  ASSERT_EQ(log.entries().size(), 2U);
+  EXPECT_EQ(log.entries()[1].line,
+            "refused 2 more check-ins of account 501, executable /usr/libexec/program");
+}
+
+TEST_F(EntitlementCheckTest, AGrantedCallerIsDescribedUntilItsProcessExitsAndNobodyElseIs) {
+  RecordingLog log;
+  EXPECT_EQ(check.describe(caller), nullptr);
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  const auto described = check.describe(caller);
+  ASSERT_NE(described, nullptr);
+  EXPECT_EQ(described->pid, 7);
+  EXPECT_EQ(described->uid, 501U);
+  EXPECT_EQ(described->executable, "/usr/libexec/program");
+  EXPECT_EQ(described->unit, "program.service");
+  EXPECT_EQ(check.describe(tokenOf(7, 200)), nullptr) << "another process by now";
+  exits(7);
+  EXPECT_EQ(check.describe(caller), nullptr);
+  EXPECT_TRUE(log.entries().empty());
 }
 
 TEST_F(EntitlementCheckTest, TwoChecksKnowNothingOfEachOther) {

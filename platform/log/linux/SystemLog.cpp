@@ -18,8 +18,10 @@
 #include <cinttypes>
 #include <cstdio>
 #include <cstring>
+#include <optional>
 
 #include "platform/base/Utf8.h"
+#include "platform/log/LogContext.h"
 
 namespace brenvik {
 namespace {
@@ -84,6 +86,21 @@ class Field {
   std::size_t size_ = 0;
 };
 
+// The fields of an entry, followed by those of the request that the line belongs to.
+template <std::size_t count>
+bool sendWithContext(const std::array<iovec, count>& own) noexcept {
+  const LogFields context;
+  std::array<std::optional<Field>, LogFields::kMost> kept;
+  std::array<iovec, count + LogFields::kMost> all;
+  std::copy(own.begin(), own.end(), all.begin());
+  std::size_t size = count;
+  for (const LogFields::Field& each : context.all()) {
+    all[size] = kept[size - count].emplace(each.key, each.value).io();
+    ++size;
+  }
+  return ::sd_journal_sendv(all.data(), static_cast<int>(size)) >= 0;
+}
+
 // Asked anew for each line, because the journal may start after the daemon; a stat costs less than the line.
 bool journalIsThere() noexcept {
   struct stat status {};
@@ -134,7 +151,7 @@ void SystemLog::unified(LogLevel level, std::string_view line, const LogPlace& p
     const Field messageId("MESSAGE_ID", Id(id).view());
     const std::array fields{message.io(),  priority.io(), identifier.io(), file.io(),
                             codeLine.io(), function.io(), messageId.io()};
-    if (::sd_journal_sendv(fields.data(), static_cast<int>(fields.size())) >= 0) return;
+    if (sendWithContext(fields)) return;
   }
   std::array<char, 8200> text;
   const int size =
@@ -154,7 +171,7 @@ void SystemLog::bsd(SyslogPriority priority, std::string_view line, const Messag
     const Field facility("SYSLOG_FACILITY", "3");
     const Field messageId("MESSAGE_ID", Id(id).view());
     const std::array fields{message.io(), level.io(), identifier.io(), facility.io(), messageId.io()};
-    if (::sd_journal_sendv(fields.data(), static_cast<int>(fields.size())) >= 0) return;
+    if (sendWithContext(fields)) return;
   }
   ::syslog(LOG_DAEMON | static_cast<int>(priority), "%s", escaped.text());
 }

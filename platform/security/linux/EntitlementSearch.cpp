@@ -499,6 +499,7 @@ std::string whyNotEntitled(const EntitlementSearch::Result& result,
                                     [](const auto& each) { return each.kind == Kind::unknown; });
     return (cause == findings.rend() ? std::string("a file") : cause->path) + " cannot be examined now";
   }
+  if (result.value.asBoolean() == true) return result.file + " gives it by now";
   if (result.value) {
     return result.file + (result.value.is(Type::boolean) ? " gives it as false" : " gives it as no boolean");
   }
