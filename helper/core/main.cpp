@@ -189,6 +189,7 @@ int run() {
                                 .idlePeriod = std::chrono::milliseconds(BRENVIK_IDLE_MILLISECONDS),
                                 .describeCaller = describeCaller};
   const int status = runHelper(baseband, platform, requests, [&requests] { requests.shutDown(); });
+  entitlements.tearDown();  // which may have something to log
   setLogSink(nullptr);
   return status;
 }

@@ -1073,6 +1073,10 @@ TEST_F(ExplanationTest, TheFileThatCameNearestIsNamedWithTheKeyThatDiffers) {
   EXPECT_EQ(explain(caller.token()), (root / "etc/b.plist").string() +
                                          " came nearest, but its Executable is /bin/sh, and the caller runs "
                                          "another file");
+  grant("etc/bb.plist", "<true/>", quoted("User", "keeper"));
+  EXPECT_EQ(explain(caller.token()),
+            (root / "etc/bb.plist").string() +
+                " came nearest, but its User is keeper (65534), and the caller is 0");
   grant("etc/c.plist", "<true/>", quoted("Unit", "x.service"));
   EXPECT_THAT(explain(caller.token()),
               testing::StartsWith((root / "etc/c.plist").string() +

@@ -503,17 +503,19 @@ std::string whyNotEntitled(const EntitlementSearch::Result& result,
   if (result.value) {
     return result.file + (result.value.is(Type::boolean) ? " gives it as false" : " gives it as no boolean");
   }
-  // The fewest keys that differ; among those, one that names the caller's executable.
+  // The fewest keys that differ; among those, one that names the caller's executable; among those, the key
+  // that is compared last.
   struct File {
     const EntitlementFinding* blame = nullptr;
     int faults = 0;
+    int passed = 0;  // before the first that differs
     bool namesCaller = false;
     bool hasName = true;
-    bool isWhole = false;  // the file as a whole is passed over, or a directory
   };
   const auto isBetter = [](const File& a, const File& b) {
     if (a.faults != b.faults) return a.faults < b.faults;
-    return a.namesCaller && !b.namesCaller;
+    if (a.namesCaller != b.namesCaller) return a.namesCaller;
+    return a.passed > b.passed;
   };
   File best;
   for (std::size_t i = 0; i < findings.size();) {
@@ -521,6 +523,7 @@ std::string whyNotEntitled(const EntitlementSearch::Result& result,
     const std::string& path = findings[i].path;
     for (; i < findings.size() && findings[i].path == path; ++i) {
       const EntitlementFinding& each = findings[i];
+      if (each.kind == Kind::holds && file.blame == nullptr) ++file.passed;
       if (each.kind == Kind::holds && each.key == "Executable") file.namesCaller = true;
       if (each.kind != Kind::differs && each.kind != Kind::wrong) continue;
       if (each.key == "Entitlements" && each.kind == Kind::differs) file.hasName = false;
