@@ -354,9 +354,16 @@ class Refusals(HelperTest):
                          {"BRENVIK_CALLER_PID": str(os.getpid()), "BRENVIK_CALLER_UID": "0",
                           "BRENVIK_CALLER_EXE": os.path.realpath(sys.executable),
                           "BRENVIK_ROUTINE": "BVMobileHelperLoadPlistFile"})
-        client.status("RequestWanIPFromLocation")
-        eventually(lambda: any(each.get("BRENVIK_ROUTINE") == "BVMobileHelperRequestWanIPFromLocation"
-                               for each in self.logs.entries), what="a line of the other request")
+        # What is answered later, by other threads: there is no network here.
+        self.assertEqual(client.status("RequestWanIPFromLocation"), 0)
+        client.channel.exchange(wire.simple("CheckLASDUpdate", (1).to_bytes(4, "little")))
+        for routine, text in (("RequestWanIPFromLocation", "_RequestWanIPFromLocation error: "),
+                              ("CheckLASDUpdate", "HTTP request failed for URL ")):
+            eventually(lambda: any(each["MESSAGE"].startswith(text) for each in self.logs.entries), what=text)
+            for each in self.logs.entries:
+                if each["MESSAGE"].startswith(text):
+                    self.assertEqual((each.get("BRENVIK_ROUTINE"), each.get("BRENVIK_CALLER_PID")),
+                                     ("BVMobileHelper" + routine, str(os.getpid())))
         for each in self.logs.entries:
             self.assertRegex(each["CODE_FUNC"], r"^~?\w+$")
 
