@@ -34,6 +34,12 @@ class Message:
             raise ValueError(f"a failure or refusal says what to do, progress does not: {self.text}")
 
     @property
+    def subject(self):
+        """Of the catalogue's entry: what has happened, the first sentence of the meaning."""
+        first = re.split(r"[.:;](?:\s|$)", self.meaning, maxsplit=1)[0]
+        return {"failure": "Failed", "refusal": "Refused", "progress": "Done"}[self.kind] + ": " + first
+
+    @property
     def id(self):
         """As platform/log makes it: FNV-1a, 128 bits."""
         value = 0x6C62272E07BB014262B821756295C58D
@@ -79,13 +85,12 @@ def messages_section():
 def catalogue():
     lines = ["# SPDX-License-" "Identifier: Apache-2.0", "# SPDX-FileCopyright" "Text: The BrenvikMobileHelper authors", ""]
     done = set()
-    for title, messages in read_messages():
+    for _, messages in read_messages():
         for each in messages:
             if each.kind == "progress" or each.id in done:
                 continue
             done.add(each.id)
-            subject = {"failure": "Something failed", "refusal": "Something was refused"}[each.kind]
-            lines += [f"-- {each.id}", f"Subject: {subject}: {title.lower()}", "Defined-By: BrenvikMobileHelper",
+            lines += [f"-- {each.id}", f"Subject: {each.subject}", "Defined-By: BrenvikMobileHelper",
                       "Documentation: man:BrenvikMobileHelper(8)", "", each.meaning, "",
                       "What to do: " + each.advice, ""]
     return lines

@@ -171,6 +171,9 @@ int run() {
   LoadedBasebandLibrary baseband;
 
   RequestsOnFirstUse<Areas> requests([&] { return std::make_unique<Areas>(queues, regions, accounts); });
+  const auto describeCaller = [&entitlements](const AuditToken& caller) {
+    return entitlements.describe(caller);
+  };
   const ServerPlatform platform{.ports = ports,
                                 .bootstrap = bootstrap,
                                 .sources = sources,
@@ -179,7 +182,8 @@ int run() {
                                     [&entitlements](const char* entitlement, const AuditToken& caller) {
                                       return entitlements.HasEntitlement(entitlement, caller);
                                     },
-                                .idlePeriod = std::chrono::milliseconds(BRENVIK_IDLE_MILLISECONDS)};
+                                .idlePeriod = std::chrono::milliseconds(BRENVIK_IDLE_MILLISECONDS),
+                                .describeCaller = describeCaller};
   return runHelper(baseband, platform, requests, [&requests] { requests.shutDown(); });
 }
 

@@ -7,6 +7,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <utility>
 
 namespace brenvik {
 namespace {
@@ -14,14 +15,29 @@ namespace {
 struct Grant {
   std::string name;
   std::uint32_t pidVersion;
+  std::shared_ptr<const LogCaller> described;  // null when memory was lacking
 };
+
+// Null without memory: a line then lacks its fields, and that is all.
+std::shared_ptr<const LogCaller> describeCaller(const AuditToken& caller, const SecurityTask* task) noexcept
+    try {
+  LogCaller described{caller.pid(), caller.uid(), {}, {}};
+  if (task != nullptr) {
+    auto facts = task->describeCaller();
+    described.executable = std::move(facts.executable);
+    described.unit = std::move(facts.unit);
+  }
+  return std::make_shared<const LogCaller>(std::move(described));
+} catch (...) {
+  return nullptr;
+}
 
 }  // namespace
 
 struct EntitlementCheck::State {
   struct Containers {
     std::multimap<pid_t, Grant> grants;
-    std::map<pid_t, std::unique_ptr<ProcessExitSource>> watchers;
+    std::map<pid_t, std::shared_ptr<ProcessExitSource>> watchers;
   };
 
   // The process has exited. Runs as the watcher's own handler, and ends that watcher.
@@ -40,8 +56,12 @@ struct EntitlementCheck::State {
   std::optional<Containers> containers{std::in_place};  // none after the teardown
 };
 
-EntitlementCheck::EntitlementCheck(TaskSecurity& security, WorkQueues& queues)
-    : security_(security), queues_(queues), state_(std::make_shared<State>()) {}
+EntitlementCheck::EntitlementCheck(TaskSecurity& security, WorkQueues& queues, RefusalLog::Clock now)
+    : security_(security), queues_(queues), refusals_(std::move(now)), state_(std::make_shared<State>()) {}
+
+std::chrono::nanoseconds EntitlementCheck::steadyTime() {
+  return std::chrono::steady_clock::now().time_since_epoch();
+}
 
 EntitlementCheck::~EntitlementCheck() { tearDown(); }
 
@@ -59,40 +79,74 @@ bool EntitlementCheck::HasEntitlement(std::string_view name, const AuditToken& c
       if (known) return true;
     }
   }
-  {
-    const auto task = security_.makeTask(caller);
-    if (task == nullptr) return false;
-    const SecurityTask::Answer answer = task->copyEntitlement(name);
-    if (answer.error || answer.value.asBoolean() != true) return false;
-  }
+  const auto task = security_.makeTask(caller);
+  const auto described = describeCaller(caller, task.get());
+  const LogContext context{described, LogScope::current().routine};
+  const LogScope scope(context);
+  const SecurityTask::Answer answer = task != nullptr ? task->copyEntitlement(name) : SecurityTask::Answer{};
   try {
-    remember(name, caller);
+    if (answer.error || answer.value.asBoolean() != true) {
+      const auto why = [&] {
+        return task != nullptr ? task->explainRefusal(name) : security_.explainNoTask(caller);
+      };
+      if (described != nullptr) refusals_.refused(*described, std::string(name).c_str(), why);
+      return false;
+    }
+    remember(name, caller, described);
+    return true;
   } catch (...) {
-    // Out of memory: granted all the same; the next question is asked afresh.
+    // Out of memory: refused without a line; or granted all the same, and the next question is asked afresh.
+    return !answer.error && answer.value.asBoolean() == true;
   }
-  return true;
 }
 
-void EntitlementCheck::remember(std::string_view name, const AuditToken& caller) {
-  const pid_t pid = caller.pid();
+std::shared_ptr<const LogCaller> EntitlementCheck::describe(const AuditToken& caller) const noexcept {
   const std::lock_guard lock(state_->mutex);
-  if (!state_->containers) return;
-  if (!state_->containers->grants.contains(pid)) {
-    // No cancel handler: the source has one owner, and goes with its entry.
-    auto source = queues_.makeProcessExitSource(pid, caller.pidVersion(),
-                                                [weak = std::weak_ptr<State>(state_), pid] {
-                                                  if (const auto state = weak.lock()) state->evict(pid);
-                                                },
-                                                {});
-    if (source != nullptr) {
-      source->activate();
-      state_->containers->watchers.insert_or_assign(pid, std::move(source));
+  if (!state_->containers) return nullptr;
+  const auto [first, last] = state_->containers->grants.equal_range(caller.pid());
+  const auto grant = std::find_if(
+      first, last, [&](const auto& entry) { return entry.second.pidVersion == caller.pidVersion(); });
+  return grant == last ? nullptr : grant->second.described;
+}
+
+void EntitlementCheck::remember(std::string_view name, const AuditToken& caller,
+                                std::shared_ptr<const LogCaller> described) {
+  const pid_t pid = caller.pid();
+  std::shared_ptr<ProcessExitSource> source;
+  {
+    const std::lock_guard lock(state_->mutex);
+    if (!state_->containers) return;
+    auto& [grants, watchers] = *state_->containers;
+    if (!grants.contains(pid)) {
+      // No cancel handler: the source goes with its entry.
+      source = queues_.makeProcessExitSource(pid, caller.pidVersion(),
+                                             [weak = std::weak_ptr<State>(state_), pid] {
+                                               if (const auto state = weak.lock()) state->evict(pid);
+                                             },
+                                             {});
+    }
+    const auto grant =
+        grants.emplace(pid, Grant{std::string(name), caller.pidVersion(), std::move(described)});
+    try {
+      if (source != nullptr) watchers.insert_or_assign(pid, source);
+    } catch (...) {
+      grants.erase(grant);
+      throw;
     }
   }
-  state_->containers->grants.emplace(pid, Grant{std::string(name), caller.pidVersion()});
+  if (source == nullptr) return;
+  // Without the lock: a process that has exited by now is told of at once, and where the telling cannot be
+  // posted it happens within this very call. Evicted or torn down meanwhile, the source is cancelled, and
+  // this does nothing.
+  try {
+    source->activate();
+  } catch (...) {
+    state_->evict(pid);  // nobody would tell of its exit
+  }
 }
 
 void EntitlementCheck::tearDown() noexcept {
+  refusals_.flush();
   const std::lock_guard lock(state_->mutex);
   if (!state_->containers) return;
   for (const auto& [pid, source] : state_->containers->watchers) source->cancel();

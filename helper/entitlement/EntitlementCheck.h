@@ -2,11 +2,14 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <chrono>
 #include <cstddef>
 #include <memory>
 #include <string_view>
 
+#include "helper/entitlement/RefusalLog.h"
 #include "platform/ipc/AuditToken.h"
+#include "platform/log/LogContext.h"
 #include "platform/runloop/WorkQueue.h"
 #include "platform/security/TaskSecurity.h"
 
@@ -17,15 +20,19 @@ namespace brenvik {
 class EntitlementCheck {
  public:
   // Both must outlive the last call of HasEntitlement. Processes are watched through `queues`; after this
-  // object is gone their exits are of no interest.
-  EntitlementCheck(TaskSecurity& security, WorkQueues& queues);
+  // object is gone their exits are of no interest. `now` counts on, from any beginning: refusals are told at
+  // times.
+  EntitlementCheck(TaskSecurity& security, WorkQueues& queues, RefusalLog::Clock now = steadyTime);
   EntitlementCheck(const EntitlementCheck&) = delete;
   EntitlementCheck& operator=(const EntitlementCheck&) = delete;
   ~EntitlementCheck();  // as tearDown
 
   // True when the caller holds it with the value true. False, too, when there is no such caller, when the
-  // service could not answer, or when the value is no boolean.
+  // service could not answer, or when the value is no boolean; the log then says why, see RefusalLog.h.
   bool HasEntitlement(std::string_view name, const AuditToken& caller) noexcept;
+
+  // Who a caller is that was granted something, for the lines that its requests cause; null when not known.
+  std::shared_ptr<const LogCaller> describe(const AuditToken& caller) const noexcept;
 
   // Stops watching and forgets every grant, for good: from then on each question goes to the service.
   void tearDown() noexcept;
@@ -36,10 +43,12 @@ class EntitlementCheck {
 
  private:
   struct State;
-  void remember(std::string_view name, const AuditToken& caller);
+  static std::chrono::nanoseconds steadyTime();
+  void remember(std::string_view name, const AuditToken& caller, std::shared_ptr<const LogCaller> described);
 
   TaskSecurity& security_;
   WorkQueues& queues_;
+  RefusalLog refusals_;
   const std::shared_ptr<State> state_;  // an exit handler that is late finds it, or finds it gone
 };
 

@@ -17,6 +17,9 @@
 #include <vector>
 
 #include "platform/base/ProcessFacts.h"
+#include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
+#include "platform/log/fakes/RecordingLog.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/security/fakes/FakeTaskSecurity.h"
@@ -238,6 +241,68 @@ TEST_F(EntitlementCheckTest, WithoutMemoryToRememberItACallerIsGrantedAllTheSame
   EXPECT_FALSE(forgetful.HasEntitlement(kName, caller));
 }
 
+// Watchers of processes that have exited already, where nothing can be posted any more: the exit is told
+// within activate(), or activate() itself finds no memory. Nothing else is used.
+class ExitsAtOnce final : public WorkQueues {
+ public:
+  enum class Activation { tells, throws };
+  explicit ExitsAtOnce(Activation activation) : activation_(activation) {}
+  WorkQueue& main() noexcept override { std::abort(); }
+  WorkQueue& global() noexcept override { std::abort(); }
+  std::shared_ptr<WorkQueue> makeSerial(std::string, QualityOfService) override { std::abort(); }
+  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t, std::uint32_t, WorkQueue::Task onExit,
+                                                           WorkQueue::Task) override {
+    return std::make_unique<Source>(activation_, std::move(onExit));
+  }
+
+ private:
+  class Source final : public ProcessExitSource {
+   public:
+    Source(Activation activation, WorkQueue::Task onExit)
+        : activation_(activation), onExit_(std::move(onExit)) {}
+    void activate() override {
+      if (activation_ == Activation::throws) throw std::bad_alloc();
+      onExit_();
+    }
+    void cancel() noexcept override {}
+
+   private:
+    const Activation activation_;
+    const WorkQueue::Task onExit_;
+  };
+  const Activation activation_;
+};
+
+using EntitlementCheckDeathTest = EntitlementCheckTest;
+
+TEST_F(EntitlementCheckDeathTest, AnExitToldWithinTheActivationForgetsTheGrantAndBlocksNobody) {
+  security.grant(caller, kName, PropertyList::boolean(true));
+  security.grant(caller, kOther, PropertyList::boolean(true));
+  // In a process of its own, which an alarm ends if it blocks.
+  EXPECT_EXIT(
+      {
+        ::alarm(20);
+        ExitsAtOnce queuesThatFail(ExitsAtOnce::Activation::tells);
+        EntitlementCheck asked(security, queuesThatFail);
+        const bool first = asked.HasEntitlement(kName, caller);
+        const bool forgotten = asked.grants() == 0 && asked.watchers() == 0;
+        const bool second = asked.HasEntitlement(kOther, caller);
+        ::_exit(first && forgotten && second && asked.grants() == 0 ? 7 : 1);
+      },
+      testing::ExitedWithCode(7), "");
+}
+
+TEST_F(EntitlementCheckTest, AProcessWhoseWatcherCannotBeActivatedIsGrantedAndAskedForAgain) {
+  ExitsAtOnce queuesThatFail(ExitsAtOnce::Activation::throws);
+  EntitlementCheck forgetful(security, queuesThatFail);
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(forgetful.HasEntitlement(kName, caller));
+  EXPECT_EQ(forgetful.grants(), 0U);
+  EXPECT_EQ(forgetful.watchers(), 0U);
+  EXPECT_TRUE(forgetful.HasEntitlement(kName, caller));
+  EXPECT_EQ(security.questions(), 2);
+}
+
 TEST_F(EntitlementCheckTest, ATokenThatNamesNoProcessIsCheckedUnderMinusOne) {
   const AuditToken nobody = tokenOf(0);
   ASSERT_EQ(nobody.pid(), -1);
@@ -302,6 +367,61 @@ TEST_F(EntitlementCheckTest, AnExitHandledAfterTheCheckIsGoneFindsNothingToDo) {
   }
   EXPECT_EQ(queues.watchersOf(7), 0U);
   EXPECT_GE(queues.global().runReady(), 1);
+}
+
+TEST_F(EntitlementCheckTest, ARefusalIsToldWithTheCallerTheEntitlementAndTheReason) {
+  RecordingLog log;
+  const LogScope request("Routine", 3);
+  security.addProcess(caller);
+  security.refusal = "no file names it, says the fake";
+  EXPECT_FALSE(check.HasEntitlement(kName, caller));
+  EXPECT_EQ(log.entries(),
+            (std::vector{RecordingLog::unifiedLine(
+                LogLevel::standard,
+                "refused process 7: account 501, executable /usr/libexec/program, unit program.service: it "
+                "does not "
+                "hold com.norvale.Teravox.BrenvikHelper.allow: no file names it, says the fake")}));
+  EXPECT_EQ(log.fields(),
+            (std::vector<std::map<std::string, std::string>>{{{"BRENVIK_CALLER_PID", "7"},
+                                                              {"BRENVIK_CALLER_UID", "501"},
+                                                              {"BRENVIK_CALLER_EXE", "/usr/libexec/program"},
+                                                              {"BRENVIK_CALLER_UNIT", "program.service"},
+                                                              {"BRENVIK_ROUTINE", "Routine"}}}));
+  log.clear();
+  EXPECT_FALSE(check.HasEntitlement(kName, tokenOf(8)));
+  EXPECT_EQ(log.entries(),
+            (std::vector{RecordingLog::unifiedLine(
+                LogLevel::standard,
+                "refused process 8: account 501, executable not known, unit none: it does not hold "
+                "com.norvale.Teravox.BrenvikHelper.allow: the caller has ended")}));
+}
+
+TEST_F(EntitlementCheckTest, RefusalsThatHadNoLineAreToldAtTheTeardown) {
+  RecordingLog log;
+  security.addProcess(caller);
+  for (int i = 0; i < 3; ++i) EXPECT_FALSE(check.HasEntitlement(kName, caller));
+  EXPECT_EQ(security.explanations(), 1);
+  check.tearDown();
+  ASSERT_EQ(log.entries().size(), 2U);
+  EXPECT_EQ(log.entries()[1].line,
+            "refused 2 more check-ins of account 501, executable /usr/libexec/program");
+}
+
+TEST_F(EntitlementCheckTest, AGrantedCallerIsDescribedUntilItsProcessExitsAndNobodyElseIs) {
+  RecordingLog log;
+  EXPECT_EQ(check.describe(caller), nullptr);
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  const auto described = check.describe(caller);
+  ASSERT_NE(described, nullptr);
+  EXPECT_EQ(described->pid, 7);
+  EXPECT_EQ(described->uid, 501U);
+  EXPECT_EQ(described->executable, "/usr/libexec/program");
+  EXPECT_EQ(described->unit, "program.service");
+  EXPECT_EQ(check.describe(tokenOf(7, 200)), nullptr) << "another process by now";
+  exits(7);
+  EXPECT_EQ(check.describe(caller), nullptr);
+  EXPECT_TRUE(log.entries().empty());
 }
 
 TEST_F(EntitlementCheckTest, TwoChecksKnowNothingOfEachOther) {

@@ -17,6 +17,7 @@
 
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
 
 namespace brenvik {
 namespace {
@@ -109,10 +110,12 @@ bool HttpFetcher::fetch(const std::string& url, WifiOnly wifiOnly, std::uint64_t
   const auto semaphore = std::make_shared<Semaphore>();
   request->setLargestBody(largestBody);
   request->setCallbackQueue(queue_);
-  request->setCompletion([this, url, semaphore](const std::shared_ptr<WebResponse>& response) {
-    completed(url, response);
-    semaphore->signal();  // last: the fetcher may be gone afterwards
-  });
+  request->setCompletion(
+      [this, url, semaphore, context = LogScope::current()](const std::shared_ptr<WebResponse>& response) {
+        const LogScope scope(context);
+        completed(url, response);
+        semaphore->signal();  // last: the fetcher may be gone afterwards
+      });
   request->send({});
   semaphore->wait();
   return !body_.empty();

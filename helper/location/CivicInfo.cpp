@@ -3,6 +3,7 @@
 #include "helper/location/BrenvikPush.h"
 #include "helper/location/GeoRequests.h"
 #include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
 
 namespace brenvik {
 
@@ -17,8 +18,9 @@ void GeoRequests::requestCivicInfoFromLatitudeLongitude(double latitude, double 
                                                            ShiftLocations::ifNeeded, nullptr);
   awaitGeoResponse(&GeoRequests::pushCivicFallback);
   ticket->submit(
-      [self = shared_from_this(), info = std::move(info)](const std::optional<MapItems>& items,
-                                                          const std::optional<GeoError>& error) {
+      [self = shared_from_this(), info = std::move(info), context = LogScope::current()](
+          const std::optional<MapItems>& items, const std::optional<GeoError>& error) {
+        const LogScope scope(context);
         const std::lock_guard lock(self->running_);
         if (!self->closed_.load()) self->handleMapItems(*info, items, error);
       },

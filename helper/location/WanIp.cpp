@@ -3,6 +3,7 @@
 #include "helper/location/BrenvikPush.h"
 #include "helper/location/GeoRequests.h"
 #include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
 
 namespace brenvik {
 
@@ -10,8 +11,9 @@ void GeoRequests::requestWanIpFromLocation() {
   const auto ticket = geoService_.makeGeoIpTicket(std::nullopt);
   awaitGeoResponse(&GeoRequests::pushWanIpFallback);
   ticket->submit(
-      [self = shared_from_this()](const std::optional<GeoIpResult>& result,
-                                  const std::optional<GeoError>& error) {
+      [self = shared_from_this(), context = LogScope::current()](const std::optional<GeoIpResult>& result,
+                                                                 const std::optional<GeoError>& error) {
+        const LogScope scope(context);
         const std::lock_guard lock(self->running_);
         if (!self->closed_.load()) self->handleGeoIpResult(result, error);
       },

@@ -5,6 +5,7 @@
 #include <array>
 
 #include "interface/Routines.h"
+#include "platform/log/LogContext.h"
 
 namespace brenvik {
 namespace {
@@ -60,6 +61,7 @@ template <std::size_t row, class Message, Call<Message> call, ReplyNdr ndr = Rep
 Outcome handle(void* context, const Request& request, Reply& reply) {
   constexpr const RoutineFacts& facts = kRequestRoutines[row];
   static_assert(sizeof(Message) == facts.requestSize);
+  const LogScope scope(facts.name, request.localPort());
 
   KernelReturn code = checkForm(facts, request);
   if (code != kern::success) {

@@ -10,6 +10,9 @@
 
 #include "helper/requests/fakes/RecordingRoutines.h"
 #include "interface/Routines.h"
+#include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
+#include "platform/log/fakes/RecordingLog.h"
 
 namespace brenvik {
 namespace {
@@ -86,6 +89,24 @@ TEST_F(RequestTableTest, EveryRowReachesItsOwnRoutineWithThePortItArrivedOn) {
     EXPECT_EQ(routines.port, kPort);
     EXPECT_EQ(outcome, Outcome::accepted);
   }
+}
+
+TEST_F(RequestTableTest, LinesOfARoutineCarryItsNameAndTheCallerOfItsPortAndLaterOnesDoNot) {
+  RecordingLog log;
+  LogCallers::shared().add(kPort, std::make_shared<LogCaller>(LogCaller{9, 0, "/usr/bin/x", ""}));
+  routines.whenCalled = [] { logUnified(LogLevel::info, "line"); };
+  for (const auto& facts : kRequestRoutines) {
+    makeRequest(facts);
+    EXPECT_EQ(deliver(facts), kern::success);
+    EXPECT_EQ(log.fields().back(),
+              (std::map<std::string, std::string>{{"BRENVIK_CALLER_PID", "9"},
+                                                  {"BRENVIK_CALLER_UID", "0"},
+                                                  {"BRENVIK_CALLER_EXE", "/usr/bin/x"},
+                                                  {"BRENVIK_ROUTINE", std::string(facts.name)}}));
+  }
+  LogCallers::shared().remove(kPort);
+  logUnified(LogLevel::info, "line");
+  EXPECT_TRUE(log.fields().back().empty());
 }
 
 TEST_F(RequestTableTest, IdsOutsideTheRangeHaveNoHandler) {

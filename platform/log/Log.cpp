@@ -42,6 +42,30 @@ MessageId messageIdOf(std::string_view format, std::string_view line) noexcept {
   return {static_cast<std::uint64_t>(hash >> 64), static_cast<std::uint64_t>(hash)};
 }
 
+std::string_view functionNameIn(std::string_view signature) noexcept {
+  std::size_t begin = 0;
+  int depth = 0;  // of template arguments
+  for (std::size_t i = 0; i < signature.size(); ++i) {
+    const char c = signature[i];
+    if (c == '<') ++depth;
+    if (c == '>') --depth;
+    if (depth != 0) continue;
+    if (c == ' ' || c == ':' || c == '*' || c == '&') begin = i + 1;
+    if (c != '(') continue;
+    // A scope without a name, as one compiler writes it.
+    if (signature.substr(i).starts_with("(anonymous")) {
+      i = std::min(signature.find(')', i), signature.size());
+      continue;
+    }
+    if (signature.substr(begin, i - begin) == "operator" && signature.substr(i).starts_with("()"))
+      ++i;
+    else
+      return signature.substr(begin, i - begin);
+    if (signature.substr(i).starts_with(")(")) return signature.substr(begin, i + 1 - begin);
+  }
+  return signature.substr(std::min(begin, signature.size()));
+}
+
 LogSink* setLogSink(LogSink* sink) noexcept { return currentSink.exchange(sink); }
 
 void logUnifiedAt(const LogPlace& place, LogLevel level, const char* format, ...) noexcept {
@@ -52,7 +76,10 @@ void logUnifiedAt(const LogPlace& place, LogLevel level, const char* format, ...
   va_start(arguments, format);
   const Line line(format, arguments);
   va_end(arguments);
-  sink->unified(level, line.view(), place, messageIdOf(format, line.view()));
+  std::array<char, 128> function{};
+  (void)functionNameIn(place.function).copy(function.data(), function.size() - 1);
+  sink->unified(level, line.view(), {place.file, place.line, function.data()},
+                messageIdOf(format, line.view()));
   errno = savedErrno;
 }
 

@@ -17,8 +17,13 @@ enum class SyslogPriority : int { error = 3, notice = 5 };
 struct LogPlace {
   const char* file;
   int line;
-  const char* function;
+  const char*
+      function;  // for a sink its name alone; in a call of logUnifiedAt the signature as the compiler has it
 };
+
+// The name in such a signature, without scope and arguments; of a lambda the name of the function that it is
+// in.
+std::string_view functionNameIn(std::string_view signature) noexcept;
 
 // The journal's name for a log text, 128 bits: made of the text itself as it stands in the source (FNV-1a),
 // so it stays as long as the text does. The catalogue that explains the texts is made by the same rule.
@@ -49,7 +54,7 @@ LogSink* setLogSink(LogSink* sink) noexcept;
 // Write one line to the unified log or to the BSD log. Any thread. A line longer than 4,096 bytes is cut.
 // Nothing is allocated; errno is left as it was. logUnified(level, format, ...) is a macro only so that the
 // journal can say where the line came from.
-#define logUnified(...) ::brenvik::logUnifiedAt({__FILE__, __LINE__, __func__}, __VA_ARGS__)
+#define logUnified(...) ::brenvik::logUnifiedAt({__FILE__, __LINE__, __PRETTY_FUNCTION__}, __VA_ARGS__)
 [[gnu::format(printf, 3, 4)]] void logUnifiedAt(const LogPlace& place, LogLevel level, const char* format,
                                                 ...) noexcept;
 [[gnu::format(printf, 2, 3)]] void logBsd(SyslogPriority priority, const char* format, ...) noexcept;

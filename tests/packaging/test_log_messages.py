@@ -77,6 +77,19 @@ class LogMessages(unittest.TestCase):
         wanted = {each.id for each in self.messages if each.kind != "progress"}
         self.assertEqual(set(ids), wanted)
 
+    def test_an_entry_of_the_catalogue_says_in_its_subject_what_has_happened(self):
+        catalogue = (BUILD / "docs" / "man" / "brenvik-mobile-helper.catalog").read_text()
+        subjects = dict(re.findall(r"^-- ([0-9a-f]{32})\nSubject: (.*)$", catalogue, flags=re.M))
+        for each in self.messages:
+            if each.kind == "progress":
+                continue
+            subject = subjects[each.id]
+            self.assertRegex(subject, r"^(Failed|Refused): \S+( \S+){2,}$")
+            self.assertIn(subject.split(": ", 1)[1], each.meaning)
+            others = [other.meaning for other in self.messages if other.kind != "progress" and other.id != each.id and
+                      subjects[other.id] == subject]
+            self.assertLessEqual(len(others), 1, f"{subject!r} does not tell which: {others}")
+
     def test_ids_are_made_by_the_rule_of_the_log(self):
         # The published value of FNV-1a for "foobar"; LogTest has the same.
         message = pages.Message(["unified error progress", "foobar", "A text."])

@@ -18,6 +18,7 @@
 #include <optional>
 #include <string>
 
+#include "tools/bvhelperctl/AccessCommand.h"
 #include "tools/bvhelperctl/CommandTable.h"
 #include "tools/support/EventStream.h"
 #include "tools/support/PropertyListText.h"
@@ -94,7 +95,8 @@ std::string entitlementAdvice() {
          "</string>\n"
          "    <key>Entitlements</key>\n"
          "    <dict><key>com.norvale.Teravox.BrenvikHelper.allow</key><true/></dict>\n"
-         "  </dict></plist>";
+         "  </dict></plist>\n"
+         "bvhelperctl access shows what the entitlement files say now, step by step.";
 }
 
 bool isTransportFailure(std::int32_t code) { return code >= BVMH_ERROR_FIRST && code <= BVMH_ERROR_LAST; }
@@ -161,6 +163,8 @@ int watch(const Settings& settings, const Values& values) {
 }
 
 int run(const Settings& settings, const Command& command, const Values& values) {
+  if (command.isLocal && std::strcmp(command.name, "access") == 0)
+    return printAccess(settings.asJson, values);
   if (command.isLocal) return watch(settings, values);
   const ClientPointer client(bvmh_client_create());
   if (client == nullptr) return fail(settings, kUnusable, "out of memory");

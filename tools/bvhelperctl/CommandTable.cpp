@@ -716,6 +716,17 @@ std::vector<Command> makeTable() {
        switchRadioLogs},
 
       {"",
+       "access",
+       "explain who would be let in, from the entitlement files",
+       {},
+       {},
+       {{"--exe", "program that asks, default this one", ValueKind::path, 0, {}, false, "FILE"},
+        {"--user", "account it runs under, default yours", ValueKind::text, 0, {}, false, "USER"},
+        {"--unit", "unit of the service manager it runs in", ValueKind::text, 0, {}, false, "UNIT"}},
+       nullptr,
+       true},
+
+      {"",
        "watch",
        "show the helper's pushes and notifications, in place of the telephony daemon",
        {},

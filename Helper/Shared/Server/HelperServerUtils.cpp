@@ -11,6 +11,7 @@
 #include <utility>
 
 #include "Helper/Shared/Server/CheckInTable.h"
+#include "interface/Routines.h"
 #include "platform/log/Log.h"
 
 namespace brenvik {
@@ -71,6 +72,7 @@ void TearDownClient(ServerContext& server, const std::shared_ptr<DeathWatch>& de
   }
   if (isUsablePort(clientPort)) {
     platform.registry.remove(clientPort);
+    LogCallers::shared().remove(clientPort);
     (void)platform.ports.dropReceiveRight(clientPort);
     (void)platform.ports.deallocateSendRight(clientPort);
   }
@@ -193,6 +195,7 @@ KernelReturn BVMobileHelperCheckIn(PortServerRegistry& registry, const ServerPla
                                    PortName servicePort, PortName callerPort, PortName* clientPort,
                                    const AuditToken& caller) {
   *clientPort = kNullPort;
+  const LogScope scope(kCheckInRoutine.name, servicePort);
   if (!platform.hasEntitlement(kAllowEntitlement, caller)) return kern::invalidSecurity;
   ServerContext* const server = LookupServer(registry, servicePort);
   if (server == nullptr) return kern::failure;
@@ -222,6 +225,7 @@ KernelReturn BVMobileHelperCheckIn(PortServerRegistry& registry, const ServerPla
   try {
     registry.add(port, server);
     registry.add(deathWatch->port(), server);
+    if (platform.describeCaller) LogCallers::shared().add(port, platform.describeCaller(caller));
     const Lock lock(server->lock);
     server->clientWatches.emplace(deathWatch.get(), ServerContext::Client{deathWatch, port});
     server->clientSources.emplace(port, source);

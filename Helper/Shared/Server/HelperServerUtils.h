@@ -14,6 +14,7 @@
 #include "interface/Messages.h"
 #include "platform/ipc/AuditToken.h"
 #include "platform/ipc/Ports.h"
+#include "platform/log/LogContext.h"
 #include "platform/runloop/RunLoop.h"
 
 // The server frame: the per-process server object, its creation and teardown, running and stopping, the busy
@@ -36,6 +37,8 @@ struct ServerPlatform {
   PortServerRegistry& registry = PortServerRegistry::shared();
   // How long the process waits before it leaves for being idle, and between the times it then asks.
   std::chrono::nanoseconds idlePeriod = std::chrono::seconds(10);
+  // Who an admitted caller is, for the fields of the lines that its requests cause; null when not known.
+  std::function<std::shared_ptr<const LogCaller>(const AuditToken& caller)> describeCaller = {};
 };
 
 class ServerContext;

@@ -9,6 +9,8 @@
 
 #include "platform/base/fakes/FailingAllocations.h"
 #include "platform/ipc/fakes/FakePorts.h"
+#include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
 
@@ -350,6 +352,28 @@ TEST_F(ServerTest, AnEntitledCallerGetsAPortOfItsOwn) {
   EXPECT_EQ(ports.sendRights.at(clientPort), 1);
   EXPECT_EQ(LookupServer(registry, clientPort), server);
   EXPECT_EQ(LookupServer(registry, callerPort), server);
+}
+
+TEST_F(ServerTest, ThePortOfAClientIsKnownToTheLogForAsLongAsTheClientIsThere) {
+  create();
+  const auto described = std::make_shared<const LogCaller>();
+  platform.describeCaller = [&](const AuditToken&) { return described; };
+  ASSERT_EQ(checkIn(), kern::success);
+  EXPECT_EQ(LogCallers::shared().find(clientPort), described);
+  clientDies(0);
+  EXPECT_EQ(LogCallers::shared().find(clientPort), nullptr);
+  EXPECT_EQ(described.use_count(), 1) << "the client leaves nothing behind";
+}
+
+TEST_F(ServerTest, LinesOfACheckInCarryItsRoutine) {
+  create();
+  platform.hasEntitlement = [](const char*, const AuditToken&) {
+    logUnified(LogLevel::info, "line");
+    return false;
+  };
+  EXPECT_EQ(checkIn(), 35);
+  EXPECT_EQ(log.fields().back(),
+            (std::map<std::string, std::string>{{"BRENVIK_ROUTINE", "BVMobileHelperCheckIn"}}));
 }
 
 TEST_F(ServerTest, ACallerWithoutTheEntitlementGets35AndNoPortAndTheIdleStateIsUnchanged) {

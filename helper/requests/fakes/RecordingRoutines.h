@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstring>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -22,6 +23,7 @@ class RecordingRoutines final : public ServerRoutines {
   std::string firstRegion;
   std::string secondRegion;
   KernelReturn answer = kern::success;
+  std::function<void()> whenCalled;  // runs within each routine
 
   KernelReturn server_BVMobileHelperSetVoicemailToken(PortName p, char* token) override {
     return note("SetVoicemailToken", p, {text(token, 256)});
@@ -154,6 +156,7 @@ class RecordingRoutines final : public ServerRoutines {
   static std::string text(const char* field, std::size_t size) { return {field, ::strnlen(field, size)}; }
   KernelReturn note(const char* name, PortName p, std::vector<std::string> arguments) {
     called = name;
+    if (whenCalled) whenCalled();
     port = p;
     texts = std::move(arguments);
     return answer;

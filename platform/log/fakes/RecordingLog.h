@@ -2,12 +2,14 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <map>
 #include <mutex>
 #include <ostream>
 #include <string>
 #include <vector>
 
 #include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
 
 namespace brenvik {
 
@@ -31,19 +33,27 @@ class RecordingLog final : public LogSink {
   void unified(LogLevel level, std::string_view line, const LogPlace&, const MessageId&) noexcept override {
     const std::lock_guard lock(mutex_);
     entries_.push_back({Entry::Channel::unified, static_cast<int>(level), std::string(line)});
+    recordFields();
   }
   void bsd(SyslogPriority priority, std::string_view line, const MessageId&) noexcept override {
     const std::lock_guard lock(mutex_);
     entries_.push_back({Entry::Channel::bsd, static_cast<int>(priority), std::string(line)});
+    recordFields();
   }
 
   std::vector<Entry> entries() const {
     const std::lock_guard lock(mutex_);
     return entries_;
   }
+  // The fields of each line's request, in the same order.
+  std::vector<std::map<std::string, std::string>> fields() const {
+    const std::lock_guard lock(mutex_);
+    return fields_;
+  }
   void clear() {
     const std::lock_guard lock(mutex_);
     entries_.clear();
+    fields_.clear();
   }
 
   static Entry unifiedLine(LogLevel level, std::string line) {
@@ -54,9 +64,15 @@ class RecordingLog final : public LogSink {
   }
 
  private:
+  void recordFields() {
+    const LogFields fields;
+    auto& recorded = fields_.emplace_back();
+    for (const auto& each : fields.all()) recorded.emplace(each.key, each.value);
+  }
   LogSink* const previous_;
   mutable std::mutex mutex_;
   std::vector<Entry> entries_;
+  std::vector<std::map<std::string, std::string>> fields_;
 };
 
 // So that a failed assertion shows the line and not its bytes.

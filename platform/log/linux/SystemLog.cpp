@@ -8,11 +8,14 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <atomic>
 #include <cinttypes>
 #include <cstdio>
+#include <span>
 
+#include "platform/log/LogContext.h"
 #include "platform/log/linux/EscapedLine.h"
 
 namespace brenvik {
@@ -20,6 +23,18 @@ namespace {
 
 constexpr char kSyslogSocket[] = "/dev/log";
 constexpr std::string_view kJournalsSyslogSocket = "/run/systemd/journal/dev-log";
+
+// Sends an entry of these fields, followed by those of the request that the line belongs to.
+template <std::size_t count>
+bool sendWithContext(Journal& journal, const std::array<JournalField, count>& own) noexcept {
+  static_assert(count + LogFields::kMost <= Journal::kMostFields);
+  const LogFields context;
+  std::array<JournalField, count + LogFields::kMost> all;
+  std::copy(own.begin(), own.end(), all.begin());
+  std::size_t size = count;
+  for (const LogFields::Field& each : context.all()) all[size++] = {each.key, each.value};
+  return journal.send(std::span(all).first(size));
+}
 
 // Whether syslog(3) would end in the journal anyway, which is then better told natively. Asked anew for each
 // line, because the journal may start after the daemon; a look costs less than the line.
@@ -82,7 +97,7 @@ void SystemLog::unified(LogLevel level, std::string_view line, const LogPlace& p
                                             {"CODE_LINE", {number.data(), static_cast<std::size_t>(digits)}},
                                             {"CODE_FUNC", place.function},
                                             {"MESSAGE_ID", messageId.view()}}};
-  if (!journal_.send(fields)) writeToStandardError(level, escaped.view());
+  if (!sendWithContext(journal_, fields)) writeToStandardError(level, escaped.view());
 }
 
 void SystemLog::bsd(SyslogPriority priority, std::string_view line, const MessageId& id) noexcept {
@@ -96,7 +111,7 @@ void SystemLog::bsd(SyslogPriority priority, std::string_view line, const Messag
                                               {"SYSLOG_IDENTIFIER", identifier_},
                                               {"SYSLOG_FACILITY", "3"},
                                               {"MESSAGE_ID", messageId.view()}}};
-    if (journal_.send(fields)) return;
+    if (sendWithContext(journal_, fields)) return;
   }
   ::syslog(LOG_DAEMON | static_cast<int>(priority), "%s", escaped.text());
 }

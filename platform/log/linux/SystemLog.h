@@ -11,9 +11,9 @@ namespace brenvik {
 // sd-daemon(3) while there is none; the BSD log on syslog(3), facility daemon. Lines are escaped
 // (EscapedLine.h), one trailing newline of a BSD line is dropped. Any thread.
 //
-// Every journal entry has the MESSAGE_ID of its text. syslog(3) cannot carry one: where /dev/log is the
-// journal's own socket, the BSD log's lines are handed to it natively, with the same identifier, priority and
-// facility.
+// Every journal entry has the MESSAGE_ID of its text, and the fields of the request it belongs to
+// (LogContext.h). syslog(3) cannot carry one: where /dev/log is the journal's own socket, the BSD log's lines
+// are handed to it natively, with the same identifier, priority and facility.
 class SystemLog final : public LogSink {
  public:
   // `identifier` is kept, not copied: a string literal.

@@ -20,6 +20,7 @@
 #include <utility>
 
 #include "platform/base/ProcessFacts.h"
+#include "platform/log/LogContext.h"
 
 namespace brenvik {
 namespace {
@@ -81,11 +82,11 @@ class SystemQueue : public WorkQueue {
   const std::string& label() const noexcept override { return label_; }
   void post(Task task) override {
     start();
-    loop_->post(std::move(task));
+    loop_->post(inCurrentLogContext(std::move(task)));
   }
   void postAfter(std::chrono::nanoseconds delay, Task task) override {
     start();
-    loop_->postAfter(delay, std::move(task));
+    loop_->postAfter(delay, inCurrentLogContext(std::move(task)));
   }
   std::unique_ptr<Timer> makeTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
                                    std::chrono::nanoseconds leeway, Task handler) override {

@@ -26,6 +26,8 @@
 #include <vector>
 
 #include "platform/base/ProcessFacts.h"
+#include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
 #include "platform/log/fakes/RecordingLog.h"
 
 namespace brenvik {
@@ -312,6 +314,40 @@ TEST_F(SystemQueuesTest, TimerOfAnotherThreadFiresOnTheLoopAndCanBeCancelledTher
   other.join();
   runUntil([&] { return firedOn != std::thread::id(); });
   EXPECT_EQ(firedOn, std::this_thread::get_id());
+}
+
+TEST_F(SystemQueuesTest, LinesOfATaskCarryTheFieldsOfTheRequestThatPostedItAndOfNoOther) {
+  RecordingLog log;
+  SystemQueues queues(*loop);
+  const auto serial = queues.makeSerial("serial", QualityOfService::standard);
+  int ran = 0;
+  LogCallers::shared().add(7, std::make_shared<LogCaller>(LogCaller{1, 2, "/x", "y.service"}));
+  {
+    const LogScope scope("Routine", 7);
+    serial->post([&] {
+      queues.main().post([&] {
+        logUnified(LogLevel::info, "back again");
+        ++ran;
+      });
+      queues.main().postAfter(1ms, [&] {
+        logUnified(LogLevel::info, "and later");
+        ++ran;
+      });
+    });
+  }
+  LogCallers::shared().remove(7);
+  runUntil([&] { return ran == 2; });
+  queues.main().post([&] {
+    logUnified(LogLevel::info, "nobody's");
+    ++ran;
+  });
+  runUntil([&] { return ran == 3; });
+  const std::map<std::string, std::string> fields{{"BRENVIK_CALLER_PID", "1"},
+                                                  {"BRENVIK_CALLER_UID", "2"},
+                                                  {"BRENVIK_CALLER_EXE", "/x"},
+                                                  {"BRENVIK_CALLER_UNIT", "y.service"},
+                                                  {"BRENVIK_ROUTINE", "Routine"}};
+  EXPECT_EQ(log.fields(), (std::vector<std::map<std::string, std::string>>{fields, fields, {}}));
 }
 
 TEST_F(SystemQueuesTest, MainQueueRunsTasksInOrderOnTheLoop) {

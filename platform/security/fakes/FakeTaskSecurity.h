@@ -39,6 +39,8 @@ class FakeTaskSecurity final : public TaskSecurity {
     return std::make_unique<Task>(*this, caller);
   }
 
+  std::string explainNoTask(const AuditToken&) noexcept override { return "the caller has ended"; }
+
   // How often a task was asked for, and how often a task was asked for a value.
   int tasksWanted() const {
     const std::lock_guard lock(mutex_);
@@ -49,6 +51,14 @@ class FakeTaskSecurity final : public TaskSecurity {
     return questions_;
   }
 
+  int explanations() const {
+    const std::lock_guard lock(mutex_);
+    return explanations_;
+  }
+
+  // What every process is and why it is refused, to be set before.
+  SecurityTask::Caller described{"/usr/libexec/program", "program.service"};
+  std::string refusal = "no file names it";
   std::function<void()> whileAsked;  // runs within each question, no lock held
 
  private:
@@ -68,6 +78,13 @@ class FakeTaskSecurity final : public TaskSecurity {
       return answer == process->second.end() ? Answer{} : answer->second;
     }
 
+    std::string explainRefusal(std::string_view) noexcept override {
+      const std::lock_guard lock(owner_.mutex_);
+      ++owner_.explanations_;
+      return owner_.refusal;
+    }
+    Caller describeCaller() const override { return owner_.described; }
+
    private:
     FakeTaskSecurity& owner_;
     const AuditToken caller_;
@@ -77,6 +94,7 @@ class FakeTaskSecurity final : public TaskSecurity {
   std::map<Key, std::map<std::string, SecurityTask::Answer>> held_;
   int tasksWanted_ = 0;
   int questions_ = 0;
+  int explanations_ = 0;
 };
 
 }  // namespace brenvik

@@ -3,6 +3,7 @@
 #include "platform/security/linux/CallerProcess.h"
 
 #include <fcntl.h>
+#include <limits.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -23,6 +24,22 @@ std::string_view takeLine(std::string_view* text) noexcept {
 
 }  // namespace
 
+// The manager of a user and the owner of a delegated unit name the groups below theirs as they like, a unit's
+// name of the system among others. Slices of the system's manager are handed to nobody, but for what stands
+// in user.slice.
+std::string_view unitOfCgroup(std::string_view path) noexcept {
+  if (!path.starts_with('/')) return {};
+  for (;;) {
+    path.remove_prefix(1);
+    const std::size_t slash = path.find('/');
+    if (slash == std::string_view::npos) return path;
+    const std::string_view above = path.substr(0, slash);
+    constexpr std::string_view kSlice = ".slice";
+    if (!above.ends_with(kSlice) || above.size() == kSlice.size() || above == "user.slice") return {};
+    path.remove_prefix(slash);
+  }
+}
+
 std::string_view unitOfCgroups(std::string_view text) noexcept {
   std::string_view path;
   while (!text.empty()) {
@@ -36,8 +53,13 @@ std::string_view unitOfCgroups(std::string_view text) noexcept {
     path = line.substr(second + 1);
     if (unified) break;
   }
-  const std::size_t slash = path.rfind('/');
-  return slash == std::string_view::npos ? std::string_view() : path.substr(slash + 1);
+  return unitOfCgroup(path);
+}
+
+std::optional<CallerProcess::FileIdentity> CallerProcess::identityAt(int folder, const char* path) noexcept {
+  struct stat facts {};
+  if (::fstatat(folder, path, &facts, 0) != 0) return std::nullopt;
+  return FileIdentity{facts.st_dev, facts.st_ino};
 }
 
 std::optional<CallerProcess> CallerProcess::pin(const std::string& proc, pid_t pid, std::uint32_t startTime) {
@@ -58,9 +80,21 @@ bool CallerProcess::runsSince(std::uint32_t startTime) const noexcept {
 }
 
 std::optional<CallerProcess::FileIdentity> CallerProcess::executable() const noexcept {
-  struct stat facts {};
-  if (::fstatat(folder_.get(), "exe", &facts, 0) != 0) return std::nullopt;
-  return FileIdentity{facts.st_dev, facts.st_ino};
+  return identityAt(folder_.get(), "exe");
+}
+
+std::string CallerProcess::executablePath() const {
+  std::array<char, PATH_MAX> path;
+  const ssize_t size = ::readlinkat(folder_.get(), "exe", path.data(), path.size());
+  return size > 0 ? std::string(path.data(), static_cast<std::size_t>(size)) : std::string();
+}
+
+std::optional<CallerProcess::FileIdentity> CallerProcess::userNamespace() const noexcept {
+  return identityAt(folder_.get(), "ns/user");
+}
+
+std::optional<CallerProcess::FileIdentity> CallerProcess::namespaceOfThisProcess(const std::string& proc) {
+  return identityAt(AT_FDCWD, (proc + "/self/ns/user").c_str());
 }
 
 UniqueFd CallerProcess::openExecutable() const noexcept {

@@ -23,14 +23,15 @@ TEST(UnitOfCgroupsTest, TheUnifiedLineGivesItsLastComponent) {
 }
 
 TEST(UnitOfCgroupsTest, TheUnifiedLineGoesBeforeTheOneNamedSystemdWhereverItStands) {
-  EXPECT_EQ(unitOfCgroups("1:name=systemd:/a/old.service\n0::/a/new.service\n"), "new.service");
-  EXPECT_EQ(unitOfCgroups("0::/a/new.service\n1:name=systemd:/a/old.service\n"), "new.service");
+  EXPECT_EQ(unitOfCgroups("1:name=systemd:/a.slice/old.service\n0::/a.slice/new.service\n"), "new.service");
+  EXPECT_EQ(unitOfCgroups("0::/a.slice/new.service\n1:name=systemd:/a.slice/old.service\n"), "new.service");
   EXPECT_EQ(unitOfCgroups("0::/\n1:name=systemd:/a/old.service\n"), "")
       << "in no unit, says the unified line";
 }
 
 TEST(UnitOfCgroupsTest, WithoutAUnifiedLineTheOneNamedSystemdCounts) {
-  EXPECT_EQ(unitOfCgroups("2:cpu,cpuacct:/x/wrong.service\n1:name=systemd:/a/old.service\n"), "old.service");
+  EXPECT_EQ(unitOfCgroups("2:cpu,cpuacct:/x.slice/wrong.service\n1:name=systemd:/a.slice/old.service\n"),
+            "old.service");
 }
 
 TEST(UnitOfCgroupsTest, OtherHierarchiesAndOtherTextsGiveNone) {
@@ -42,8 +43,22 @@ TEST(UnitOfCgroupsTest, OtherHierarchiesAndOtherTextsGiveNone) {
   EXPECT_EQ(unitOfCgroups("::\n:\n0\n"), "");
 }
 
+TEST(UnitOfCgroupsTest, OnlySlicesOfTheSystemsManagerMayStandAboveAUnit) {
+  EXPECT_EQ(unitOfCgroup("/a.slice/a-b.slice/c.scope"), "c.scope");
+  EXPECT_EQ(unitOfCgroup("/init.scope"), "init.scope");
+  EXPECT_EQ(unitOfCgroup("/user.slice/c.service"), "");
+  EXPECT_EQ(unitOfCgroup("/a.slice/user.slice/c.service"), "");
+  EXPECT_EQ(unitOfCgroup("/a.service/c.service"), "");
+  EXPECT_EQ(unitOfCgroup("/a.scope/b.slice/c.service"), "");
+  EXPECT_EQ(unitOfCgroup("/.slice/c.service"), "");
+  EXPECT_EQ(unitOfCgroup("/../../c.service"), "");
+  EXPECT_EQ(unitOfCgroup("//c.service"), "");
+  EXPECT_EQ(unitOfCgroup("/"), "");
+  EXPECT_EQ(unitOfCgroup(""), "");
+}
+
 TEST(UnitOfCgroupsTest, AColonInThePathBelongsToThePath) {
-  EXPECT_EQ(unitOfCgroups("0::/a:b/c:d.service\n"), "c:d.service");
+  EXPECT_EQ(unitOfCgroups("0::/a:b.slice/c:d.service\n"), "c:d.service");
 }
 
 TEST(CallerProcessTest, ThisProcessIsFoundWithTheFileItExecutes) {
@@ -55,6 +70,9 @@ TEST(CallerProcessTest, ThisProcessIsFoundWithTheFileItExecutes) {
   ASSERT_EQ(::stat("/proc/self/exe", &facts), 0);
   EXPECT_EQ(process->executable(), (CallerProcess::FileIdentity{facts.st_dev, facts.st_ino}));
   EXPECT_TRUE(process->openExecutable().isValid());
+  EXPECT_EQ(process->executablePath(), std::filesystem::read_symlink("/proc/self/exe"));
+  EXPECT_TRUE(process->userNamespace());
+  EXPECT_EQ(process->userNamespace(), CallerProcess::namespaceOfThisProcess("/proc"));
 }
 
 TEST(CallerProcessTest, AProcessThatStartedAtAnotherTimeIsNotTheOneWanted) {
@@ -90,6 +108,8 @@ TEST(CallerProcessTest, AProcessThatExitedRunsNoLongerWhetherItsParentKnowsOrNot
   ASSERT_EQ(::waitpid(child, nullptr, 0), child);
   EXPECT_FALSE(process->executable()) << "it is gone";
   EXPECT_FALSE(process->openExecutable().isValid());
+  EXPECT_EQ(process->executablePath(), "");
+  EXPECT_FALSE(process->userNamespace());
   EXPECT_EQ(process->unit(), "");
 }
 

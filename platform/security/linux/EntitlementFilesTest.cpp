@@ -39,10 +39,6 @@ extern "C" ssize_t read(int fd, void* bytes, std::size_t size) {
 extern "C" ssize_t getdents64(int fd, void* bytes, std::size_t size) noexcept {
   return brenvik::FailingCall::failsNow("getdents64") ? -1 : ::syscall(SYS_getdents64, fd, bytes, size);
 }
-extern "C" int stat(const char* path, struct stat* facts) noexcept {
-  if (brenvik::FailingCall::failsNow("stat")) return -1;
-  return static_cast<int>(::syscall(SYS_newfstatat, AT_FDCWD, path, facts, 0));
-}
 extern "C" int openat(int directory, const char* path, int flags, ...) {
   if (brenvik::FailingCall::failsNow("openat")) return -1;
   return static_cast<int>(::syscall(SYS_openat, directory, path, flags, 0));
@@ -175,6 +171,9 @@ class EntitlementFilesTest : public testing::Test {
   std::string line(const char* before, const fs::path& path, const char* after) {
     return before + path.string() + after;
   }
+  std::string passedOver(const char* name, const std::string& why) {
+    return "entitlement file " + (root / name).string() + " passed over: " + why;
+  }
   void expectOneError(const std::string& text) {
     EXPECT_THAT(log.entries(), ElementsAre(RecordingLog::unifiedLine(LogLevel::error, text)));
     log.clear();
@@ -244,13 +243,19 @@ TEST_F(EntitlementFilesTest, AProgramReplacedUnderTheRunningCallerIsAnotherProgr
 
 TEST_F(EntitlementFilesTest, AnExecutableThatIsNoAbsolutePathOrDoesNotExistMatchesNothing) {
   const Child caller(program);
-  write("etc/a.plist", document(quoted("Executable", "program") + held()));
-  expectNothing(caller.token(), "relative");
   write("etc/a.plist", document(quoted("Executable", (root / "gone").string()) + held()));
   expectNothing(caller.token(), "missing");
+  write("etc/a.plist", document(quoted("Executable", program + "/x") + held()));
+  expectNothing(caller.token(), "below a file");
+  write("etc/a.plist", document(quoted("Executable", program + "/") + held()));
+  expectNothing(caller.token(), "as a folder");
+  EXPECT_THAT(log.entries(), IsEmpty()) << "a program may be installed later";
+  write("etc/a.plist", document(quoted("Executable", "program") + held()));
+  expectNothing(caller.token(), "relative");
+  expectOneError(passedOver("etc/a.plist", "Executable is not an absolute path"));
   write("etc/a.plist", document(held()));
   expectNothing(caller.token(), "not named");
-  EXPECT_THAT(log.entries(), IsEmpty());
+  expectOneError(passedOver("etc/a.plist", "Executable is missing"));
 }
 
 TEST_F(EntitlementFilesTest, TheAccountOfTheMessageDecidesAndRootIsTheDefault) {
@@ -266,8 +271,12 @@ TEST_F(EntitlementFilesTest, ANamedAccountIsLookedUpAndCompared) {
   const Child caller(program);
   expectGranted(caller.token(kStranger));
   expectNothing(caller.token(0), "root is not keeper");
+  EXPECT_THAT(log.entries(), IsEmpty());
   accounts.accounts.clear();
   expectNothing(caller.token(kStranger), "no such account");
+  expectOneError(passedOver("etc/a.plist", "User is \"keeper\", and there is no such account"));
+  expectNothing(caller.token(0), "nor root");
+  expectOneError(passedOver("etc/a.plist", "User is \"keeper\", and there is no such account"));
 }
 
 TEST_F(EntitlementFilesTest, TheAccountComesFirstSoThatNothingOfAStrangerIsLookedAt) {
@@ -348,31 +357,89 @@ TEST_F(EntitlementFilesTest, ATextWithANulInItNamesNoFileAndNoAccount) {
   expectGranted(caller.token());
   writeWith(program + nul + "x", "keeper");
   expectNothing(caller.token());
+  expectOneError(passedOver("etc/a.plist", "Executable is not an absolute path"));
   writeWith(program, "keeper" + nul + "x");
   expectNothing(caller.token());
+  EXPECT_EQ(log.entries().size(), 1U);
 }
 
-struct WrongType {
+struct WrongKey {
   const char* name;
   const char* keys;  // after Executable and Entitlements
+  const char* told;
 };
-class WrongTypeTest : public EntitlementFilesTest, public testing::WithParamInterface<WrongType> {};
+class WrongKeyTest : public EntitlementFilesTest, public testing::WithParamInterface<WrongKey> {};
 
-TEST_P(WrongTypeTest, AKeyOfTheWrongTypeMakesTheFileNoMatch) {
+TEST_P(WrongKeyTest, AWrongKeyMakesTheFileNoMatchAndIsToldWhoeverAsks) {
   write("etc/a.plist", document(quoted("Executable", program) + held() + GetParam().keys));
   const Child caller(program);
-  expectNothing(caller.token());
-  EXPECT_THAT(log.entries(), IsEmpty());
+  for (const uid_t account : {uid_t{0}, kStranger}) {
+    expectNothing(caller.token(account));
+    expectOneError(passedOver("etc/a.plist", GetParam().told));
+  }
   grant("etc/b.plist");
   expectGranted(caller.token(), "the next file is asked");
 }
-INSTANTIATE_TEST_SUITE_P(EveryKey, WrongTypeTest,
-                         testing::Values(WrongType{"Executable", "<key>Executable</key><integer>1</integer>"},
-                                         WrongType{"User", "<key>User</key><integer>0</integer>"},
-                                         WrongType{"Unit", "<key>Unit</key><array/>"},
-                                         WrongType{"SHA256", "<key>SHA256</key><data></data>"},
-                                         WrongType{"Entitlements", "<key>Entitlements</key><array/>"}),
-                         [](const auto& test) { return std::string(test.param.name); });
+INSTANTIATE_TEST_SUITE_P(
+    EveryKey, WrongKeyTest,
+    testing::Values(
+        WrongKey{"Executable", "<key>Executable</key><integer>1</integer>",
+                 "Executable is an integer, not a string"},
+        WrongKey{"User", "<key>User</key><true/>", "User is a boolean, not a string"},
+        WrongKey{"Unit", "<key>Unit</key><array/>", "Unit is an array, not a string"},
+        WrongKey{"EmptyUnit", "<key>Unit</key><string></string>", "Unit is not the name of a unit"},
+        WrongKey{"PathAsUnit", "<key>Unit</key><string>/system.slice/x.service</string>",
+                 "Unit is not the name of a unit"},
+        WrongKey{"SHA256", "<key>SHA256</key><data></data>", "SHA256 is data, not a string"},
+        WrongKey{"ShortSHA256", "<key>SHA256</key><string>00</string>",
+                 "SHA256 is not 64 hexadecimal digits"},
+        WrongKey{"Entitlements", "<key>Entitlements</key><real>1</real>",
+                 "Entitlements is a real, not a dictionary"},
+        WrongKey{"Two", "<key>Unit</key><date>2001-01-01T00:00:00Z</date><key>Executable</key><dict/>",
+                 "Executable is a dictionary, not a string; Unit is a date, not a string"}),
+    [](const auto& test) { return std::string(test.param.name); });
+
+TEST_F(EntitlementFilesTest, WhatIsWrongIsToldOnceForEachStateOfTheFile) {
+  const Child caller(program);
+  auto files = makeFiles();
+  const auto ask = [&] { EXPECT_FALSE(files.makeTask(caller.token())->copyEntitlement(kName).value); };
+  const std::string type = passedOver("etc/a.plist", "User is an integer, not a string");
+  grant("etc/a.plist", "<true/>", "<key>User</key><integer>0</integer>");
+  ask();
+  expectOneError(type);
+  ask();
+  EXPECT_THAT(log.entries(), IsEmpty()) << "the same file once more";
+  grant("etc/a.plist", "<true/>", "<key>User</key><integer>00</integer>");
+  ask();
+  expectOneError(type);
+  grant("etc/a.plist", "<false/>");
+  EXPECT_EQ(files.makeTask(caller.token())->copyEntitlement(kName).value, PropertyList::boolean(false));
+  EXPECT_THAT(log.entries(), IsEmpty());
+
+  // The executable has changed, and the file has not.
+  const std::string executable =
+      passedOver("etc/a.plist", "Executable cannot be relied on: " + program +
+                                    " is not owned by root, or others may write to it");
+  for (int i = 0; i < 2; ++i) {
+    ASSERT_EQ(::chmod(program.c_str(), 0775), 0);
+    ask();
+    expectOneError(executable);
+    ask();
+    EXPECT_THAT(log.entries(), IsEmpty());
+    ASSERT_EQ(::chmod(program.c_str(), 0755), 0);
+    (void)files.makeTask(caller.token())->copyEntitlement(kName);
+    EXPECT_THAT(log.entries(), IsEmpty());
+  }
+
+  // A directory is told once, however often its content changes.
+  ASSERT_EQ(::chmod((root / "etc").c_str(), 0775), 0);
+  ask();
+  EXPECT_EQ(log.entries().size(), 1U);
+  log.clear();
+  write("etc/another", "");
+  ask();
+  EXPECT_THAT(log.entries(), IsEmpty());
+}
 
 TEST_F(EntitlementFilesTest, TheDigestMustMatchWhenItIsGiven) {
   const UniqueFd fd(::open(program.c_str(), O_RDONLY | O_CLOEXEC));
@@ -391,6 +458,7 @@ TEST_F(EntitlementFilesTest, TheDigestMustMatchWhenItIsGiven) {
   expectNothing(caller.token(), "another digest");
   hex.pop_back();
   grant("etc/a.plist", "<true/>", quoted("SHA256", hex));
+  EXPECT_THAT(log.entries(), IsEmpty());
   expectNothing(caller.token(), "no digest at all");
   grant("etc/a.plist", "<true/>", quoted("SHA256", ""));
   expectNothing(caller.token(), "empty");
@@ -472,10 +540,9 @@ TEST_F(EntitlementFilesTest, ADirectoryThatIsNoneIsPassedOverAndReported) {
 }
 
 TEST_F(EntitlementFilesTest, AnExecutableThatCannotBeTrustedMakesItsFilePassedOverAndReported) {
-  const auto file = grant("etc/a.plist");
-  const std::string text =
-      line("entitlement file ", file,
-           " passed over: its executable is not owned by root, or others may write to it");
+  grant("etc/a.plist");
+  const std::string text = passedOver("etc/a.plist", "Executable cannot be relied on: " + program +
+                                                         " is not owned by root, or others may write to it");
   const Child caller(program);
   for (const mode_t mode : {0775U, 0757U}) {
     ASSERT_EQ(::chmod(program.c_str(), mode), 0);
@@ -486,6 +553,103 @@ TEST_F(EntitlementFilesTest, AnExecutableThatCannotBeTrustedMakesItsFilePassedOv
   ASSERT_EQ(::chown(program.c_str(), kStranger, 0), 0);
   expectNothing(caller.token());
   expectOneError(text);
+}
+
+// What a path of folders and links is worth as Executable, when the program itself is root's.
+class FoldersAboveTest : public EntitlementFilesTest {
+ protected:
+  void SetUp() override {
+    EntitlementFilesTest::SetUp();
+    if (IsSkipped()) return;
+    fs::create_directories(root / "a/b");
+    for (const char* const folder : {"a", "a/b"}) ASSERT_EQ(::chmod((root / folder).c_str(), 0755), 0);
+    fs::rename(program, root / "a/b/program");
+    program = (root / "a/b/program").string();
+  }
+  void grantFor(const fs::path& executable) {
+    write("etc/a.plist", document(quoted("Executable", executable.string()) + held()));
+  }
+  void expectDistrust(const AuditToken& caller, const fs::path& place, const char* why = "") {
+    expectNothing(caller, why);
+    expectOneError(passedOver("etc/a.plist", "Executable cannot be relied on: " + place.string() +
+                                                 " is not owned by root, or others may write to it"));
+  }
+};
+
+TEST_F(FoldersAboveTest, EachFolderAboveTheExecutableMustBeRootsAlone) {
+  grantFor(program);
+  const Child caller(program);
+  expectGranted(caller.token());
+  for (const char* const folder : {"a", "a/b"}) {
+    const fs::path place = root / folder;
+    for (const mode_t mode : {0775U, 0757U}) {
+      ASSERT_EQ(::chmod(place.c_str(), mode), 0);
+      expectDistrust(caller.token(), place);
+    }
+    ASSERT_EQ(::chmod(place.c_str(), 0755), 0);
+    ASSERT_EQ(::chown(place.c_str(), kStranger, 0), 0);
+    expectDistrust(caller.token(), place, "its owner can rename what is in it");
+    ASSERT_EQ(::chmod(place.c_str(), 01777), 0);
+    expectDistrust(caller.token(), place, "with the sticky bit, too");
+    ASSERT_EQ(::chown(place.c_str(), 0, 0), 0);
+    expectGranted(caller.token(), "in a folder of root's with the sticky bit root's entries stay");
+    ASSERT_EQ(::chmod(place.c_str(), 0755), 0);
+  }
+}
+
+TEST_F(FoldersAboveTest, ALinkOnTheWayMustBeRootsAndStandWhereOnlyRootCanReplaceIt) {
+  const Child caller(program);
+  fs::create_directory(root / "links");
+  ASSERT_EQ(::chmod((root / "links").c_str(), 01777), 0);
+  for (const char* const target : {"../a", "../links/../a/.", "../a/b/.."}) {
+    fs::create_symlink(target, root / "links/a");
+    grantFor(root / "links/a/b/program");
+    expectGranted(caller.token(), target);
+    ASSERT_EQ(::lchown((root / "links/a").c_str(), kStranger, 0), 0);
+    expectDistrust(caller.token(), root / "links/a", "its owner could replace it");
+    fs::remove(root / "links/a");
+  }
+  fs::create_symlink(root / "a/b/program", root / "links/absolute");
+  grantFor(root / "links/absolute");
+  expectGranted(caller.token());
+  ASSERT_EQ(::chmod((root / "links").c_str(), 0777), 0);
+  expectDistrust(caller.token(), root / "links", "anybody could replace the link");
+  fs::create_symlink("round", root / "a/round");
+  grantFor(root / "a/round/program");
+  expectNothing(caller.token(), "a circle leads nowhere");
+  EXPECT_THAT(log.entries(), IsEmpty());
+}
+
+TEST_F(FoldersAboveTest, AFolderSwappedByItsOwnerGivesTheEntitlementToNobody) {
+  // The owner of a/b moves root's program away and leads the path to another program of root's.
+  grantFor(program);
+  const fs::path other = root / "other";
+  fs::copy_file(program, other);
+  ASSERT_EQ(::chmod(other.c_str(), 0755), 0);
+  ASSERT_EQ(::chown((root / "a").c_str(), kStranger, 0), 0);
+  fs::rename(root / "a/b", root / "a/c");
+  fs::create_directory(root / "a/b");
+  fs::create_hard_link(other, root / "a/b/program");
+  const Child caller(other.string());
+  expectDistrust(caller.token(), root / "a");
+}
+
+TEST_F(EntitlementFilesTest, EachFolderAboveTheFilesMustBeRootsAlone) {
+  fs::create_directories(root / "above/etc");
+  for (const char* const folder : {"above", "above/etc"})
+    ASSERT_EQ(::chmod((root / folder).c_str(), 0755), 0);
+  grant("above/etc/a.plist");
+  const Child caller(program);
+  EntitlementFiles files(accounts, {(root / "above/etc").string()});
+  const auto isGranted = [&] {
+    return files.makeTask(caller.token())->copyEntitlement(kName).value.hasValue();
+  };
+  EXPECT_TRUE(isGranted());
+  ASSERT_EQ(::chown((root / "above").c_str(), kStranger, 0), 0);
+  EXPECT_FALSE(isGranted());
+  EXPECT_FALSE(isGranted());
+  expectOneError("entitlement directory " + (root / "above/etc").string() + " passed over: " +
+                 (root / "above").string() + " is not owned by root, or others may write to it");
 }
 
 TEST_F(EntitlementFilesTest, ALinkIsPassedOverAndReported) {
@@ -559,6 +723,7 @@ TEST_F(EntitlementFilesTest, ACallerThatIsGoneOrAwaitsItsParentOrIsAnotherOneIsN
   token = caller.token();
   caller.kill();
   EXPECT_EQ(files.makeTask(token), nullptr) << "gone";
+  EXPECT_EQ(files.explainNoTask(token), "the caller has ended");
 
   token.words[5] = 0;
   EXPECT_EQ(files.makeTask(token), nullptr) << "a token that names no process";
@@ -608,6 +773,12 @@ class MadeUpProcessTest : public EntitlementFilesTest {
     write("proc/7/stat", statText('S', 100));
     write("proc/7/cgroup", "0::/system.slice/caller.service\n");
     fs::create_symlink(program, root / "proc/7/exe");
+    for (const char* const process : {"7", "self"}) {
+      fs::create_directories(root / "proc" / process / "ns");
+      write((std::string("proc/") + process + "/ns/user").c_str(), "");
+    }
+    fs::remove(root / "proc/7/ns/user");
+    fs::create_symlink("../../self/ns/user", root / "proc/7/ns/user");
     token.words = {~0U, 0, 0, 0, 0, 7, 1, 100};
   }
   static std::string statText(char state, int startTime) {
@@ -654,6 +825,42 @@ TEST_F(MadeUpProcessTest, AUnitIsFoundInTheHierarchyNamedSystemdWhereThereIsNoUn
   write("proc/7/cgroup", "4:cpu:/\n1:name=systemd:/system.slice/caller.service\n");
   grant("etc/a.plist", "<true/>", quoted("Unit", "caller.service"));
   EXPECT_TRUE(askHere().value);
+}
+
+TEST_F(MadeUpProcessTest, AUnitsNameThatAnotherThanTheSystemsManagerGaveIsNoUnit) {
+  grant("etc/a.plist", "<true/>", quoted("Unit", "caller.service"));
+  for (const char* const forged :
+       {"/user.slice/user-501.slice/user@501.service/app.slice/caller.service",
+        "/user.slice/user-501.slice/caller.service", "/user.slice/caller.service",
+        "/system.slice/container.service/caller.service",
+        "/machine.slice/x.scope/system.slice/caller.service", "/x/caller.service", "/.slice/caller.service",
+        "/../caller.service", "/system.slice//caller.service", "/system.slice/caller.service/",
+        "/system.slice/caller.service (deleted)"}) {
+    write("proc/7/cgroup", std::string("0::") + forged + "\n");
+    EXPECT_FALSE(askHere().value) << forged;
+    write("proc/7/cgroup", std::string("1:name=systemd:") + forged + "\n");
+    EXPECT_FALSE(askHere().value) << forged;
+  }
+  for (const char* const real : {"/caller.service", "/system.slice/caller.service",
+                                 "/system.slice/system-caller.slice/caller.service"}) {
+    write("proc/7/cgroup", std::string("0::") + real + "\n");
+    EXPECT_TRUE(askHere().value) << real;
+  }
+}
+
+TEST_F(MadeUpProcessTest, ACallerInAnotherUserNamespaceOrInOneThatCannotBeToldIsNoTask) {
+  grant("etc/a.plist");
+  EXPECT_TRUE(askHere().value);
+  auto files = makeFiles((root / "proc").string());
+  fs::remove(root / "proc/7/ns/user");
+  EXPECT_EQ(files.makeTask(token), nullptr);
+  EXPECT_EQ(files.explainNoTask(token), "the caller's user namespace cannot be told");
+  write("proc/7/ns/user", "");
+  EXPECT_EQ(files.makeTask(token), nullptr);
+  EXPECT_EQ(files.explainNoTask(token), "the caller is in a user namespace of its own");
+  fs::remove(root / "proc/self/ns/user");
+  fs::remove(root / "proc/7/ns/user");
+  EXPECT_EQ(files.makeTask(token), nullptr) << "two that cannot be told are not the same";
 }
 
 TEST_F(MadeUpProcessTest, AnEmptyUnitIsNotTheUnitOfACallerThatIsInNone) {
@@ -706,7 +913,7 @@ TEST_F(EntitlementFilesTest, OutOfDescriptorsTheQuestionCannotBeAnsweredAndALate
 
   limitTo(next);  // not even the directory
   auto answer = task->copyEntitlement(kName);
-  limitTo(next + 1);  // the directory, but not the file
+  limitTo(next + 2);  // the directory and the walk to it, but not the file
   const auto second = task->copyEntitlement(kName);
   limitTo(next);
   const auto noTask = files.makeTask(caller.token());
@@ -742,10 +949,17 @@ TEST_F(EntitlementFilesTest, WhatTheSystemCannotSayNowIsNoNoAndNoLaterFileAnswer
   const Child caller(program);
   const auto task = files.makeTask(caller.token());
   ASSERT_NE(task, nullptr);
-  for (const Case& which : {Case{"getdents64", EIO, 0, "etc"}, Case{"openat", EMFILE, 0, "etc/a.plist"},
-                            Case{"read", EIO, 0, "etc/a.plist"}, Case{"stat", EIO, 0, "etc/a.plist"},
-                            Case{"stat", ENOMEM, 0, "etc/a.plist"}, Case{"openat", EMFILE, 1, "etc/a.plist"},
-                            Case{"read", EIO, 1, "etc/a.plist"}}) {
+  const auto depth = [](const fs::path& path) {
+    return static_cast<int>(std::distance(path.begin(), path.end())) - 1;
+  };
+  const int directory = depth(root / "etc");  // openings of the walk to it, and then of itself
+  const int executable = directory + 2 + depth(program);
+  for (const Case& which :
+       {Case{"getdents64", EIO, 0, "etc"}, Case{"openat", EMFILE, 0, "etc"},
+        Case{"openat", ENOMEM, directory, "etc"}, Case{"openat", EMFILE, directory + 1, "etc/a.plist"},
+        Case{"read", EIO, 0, "etc/a.plist"}, Case{"openat", EIO, directory + 2, "etc/a.plist"},
+        Case{"openat", ENOMEM, executable - 1, "etc/a.plist"},
+        Case{"openat", EMFILE, executable, "etc/a.plist"}, Case{"read", EIO, 1, "etc/a.plist"}}) {
     const FailingCall failing(which.call, which.error, which.skipped);
     const auto answer = task->copyEntitlement(kName);
     EXPECT_TRUE(answer.error) << which.call << which.skipped;
@@ -760,6 +974,7 @@ TEST_F(EntitlementFilesTest, AFileThatGoesAfterItWasListedIsPassedOverInSilence)
   grant("etc/a.plist", "<true/>", quoted("User", "keeper"));
   grant("etc/b.plist", "<false/>");
   grant("lib/c.plist", "<true/>");
+  accounts.accounts["keeper"] = {AccountIds{kStranger, 1}, std::nullopt};
   accounts.whenAskedForIds = [&](const std::string&) { fs::remove(root / "etc/b.plist"); };
   const Child caller(program);
   expectGranted(caller.token());
@@ -831,6 +1046,74 @@ TEST_F(EntitlementFilesTest, WithoutMemoryTheQuestionCannotBeAnsweredAndALaterFi
     EXPECT_GE(withoutTask, 1);
     EXPECT_GT(withoutAnswer, 5);
   }
+}
+
+// ----- What is told of a refusal -----
+
+class ExplanationTest : public EntitlementFilesTest {
+ protected:
+  std::string explain(const AuditToken& caller) {
+    auto files = makeFiles();
+    const auto task = files.makeTask(caller);
+    return task == nullptr ? "no task" : task->explainRefusal(kName);
+  }
+};
+
+TEST_F(ExplanationTest, TheFileThatCameNearestIsNamedWithTheKeyThatDiffers) {
+  accounts.accounts["keeper"] = {AccountIds{kStranger, 1}, std::nullopt};
+  const Child caller(program);
+  EXPECT_EQ(explain(caller.token()), "no file names it");
+  write("etc/0.plist", document(quoted("Executable", program) + "<key>Entitlements</key><dict/>"));
+  EXPECT_EQ(explain(caller.token()), "no file names it");
+  write("etc/a.plist", document(quoted("Executable", "/bin/sh") + quoted("User", "keeper") + held()));
+  EXPECT_EQ(
+      explain(caller.token()),
+      (root / "etc/a.plist").string() + " came nearest, but its User is keeper (65534), and the caller is 0");
+  write("etc/b.plist", document(quoted("Executable", "/bin/sh") + held()));
+  EXPECT_EQ(explain(caller.token()), (root / "etc/b.plist").string() +
+                                         " came nearest, but its Executable is /bin/sh, and the caller runs "
+                                         "another file");
+  grant("etc/bb.plist", "<true/>", quoted("User", "keeper"));
+  EXPECT_EQ(explain(caller.token()),
+            (root / "etc/bb.plist").string() +
+                " came nearest, but its User is keeper (65534), and the caller is 0");
+  grant("etc/c.plist", "<true/>", quoted("Unit", "x.service"));
+  EXPECT_THAT(explain(caller.token()),
+              testing::StartsWith((root / "etc/c.plist").string() +
+                                  " came nearest, but its Unit is x.service, and the "
+                                  "caller runs in "));
+  fs::remove(root / "etc/c.plist");
+  grant("etc/d.plist", "<true/>", quoted("SHA256", std::string(64, '0')));
+  EXPECT_EQ(explain(caller.token()), (root / "etc/d.plist").string() +
+                                         " came nearest, but its SHA256 is not the digest of the executable");
+  grant("etc/e.plist", "<false/>");
+  EXPECT_EQ(explain(caller.token()), (root / "etc/e.plist").string() + " gives it as false");
+  grant("etc/e.plist", "<string>true</string>");
+  EXPECT_EQ(explain(caller.token()), (root / "etc/e.plist").string() + " gives it as no boolean");
+  EXPECT_THAT(log.entries(), IsEmpty());
+}
+
+TEST_F(ExplanationTest, AFileThatIsPassedOverIsNamedWithWhatIsWrong) {
+  const Child caller(program);
+  const auto file = grant("etc/a.plist", "<true/>", "<key>User</key><integer>0</integer>");
+  EXPECT_EQ(explain(caller.token()),
+            file.string() + " came nearest, but its User is an integer, not a string");
+  grant("etc/a.plist");
+  ASSERT_EQ(::chmod(file.c_str(), 0666), 0);
+  EXPECT_EQ(explain(caller.token()),
+            file.string() + " is passed over: not owned by root, or others may write to it");
+  EXPECT_THAT(log.entries(), IsEmpty()) << "a search that explains logs nothing";
+}
+
+TEST_F(ExplanationTest, ACallerThatHasEndedIsToldAsSuch) {
+  grant("etc/a.plist");
+  auto files = makeFiles();
+  Child caller(program);
+  const auto task = files.makeTask(caller.token());
+  ASSERT_NE(task, nullptr);
+  EXPECT_EQ(task->describeCaller().executable, program);
+  caller.kill();
+  EXPECT_EQ(task->explainRefusal(kName), "the caller has ended, or has become another program");
 }
 
 TEST_F(EntitlementFilesTest, NoDescriptorIsLeftBehind) {

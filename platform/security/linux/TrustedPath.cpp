@@ -1,0 +1,109 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/security/linux/TrustedPath.h"
+
+#include <fcntl.h>
+#include <limits.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <string_view>
+#include <utility>
+
+namespace brenvik {
+namespace {
+
+constexpr int kMostLinks = 40;  // as many as the kernel follows
+
+bool isFolderToTrust(const struct stat& facts) noexcept {
+  const bool nobodyRenamesRootsEntries = (facts.st_mode & S_ISVTX) != 0;
+  return isRootsAlone(facts) || (facts.st_uid == 0 && nobodyRenamesRootsEntries);
+}
+
+TrustedPath withError(int error) {
+  TrustedPath result;
+  // Nobody can execute what even root cannot reach; a lack of memory or descriptors says nothing of what is
+  // there.
+  const bool isShortage = error == ENOMEM || error == EIO || error == EMFILE || error == ENFILE;
+  result.outcome = isShortage ? TrustedPath::Outcome::unknown : TrustedPath::Outcome::missing;
+  result.error = error;
+  return result;
+}
+
+// The first component of a path, taken from it; empty at its end.
+std::string takeComponent(std::string* path) {
+  const std::size_t begin = path->find_first_not_of('/');
+  if (begin == std::string::npos) {
+    path->clear();
+    return {};
+  }
+  const std::size_t end = path->find('/', begin);
+  std::string component = path->substr(begin, end == std::string::npos ? end : end - begin);
+  path->erase(0, end);
+  return component;
+}
+
+void goUp(std::string* place) {
+  place->erase(place->rfind('/') == std::string::npos ? 0 : place->rfind('/'));
+}
+
+}  // namespace
+
+bool isRootsAlone(const struct stat& facts) noexcept {
+  return facts.st_uid == 0 && (facts.st_mode & (S_IWGRP | S_IWOTH)) == 0;
+}
+
+TrustedPath walkTrustedPath(const std::string& path) {
+  TrustedPath at;
+  const auto startAtTop = [&at] {
+    at.fd.reset(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    at.place.clear();
+    return ::fstat(at.fd.get(), &at.facts) == 0;  // fails when nothing is open
+  };
+  if (!startAtTop()) return withError(errno);
+  std::string rest = path;
+  int links = 0;
+  for (;;) {
+    const std::string name = takeComponent(&rest);
+    if (name.empty()) break;
+    // Judged before anything in it is looked up, and only as a folder: it has a component behind it.
+    if (S_ISDIR(at.facts.st_mode) && !isFolderToTrust(at.facts)) {
+      at.outcome = TrustedPath::Outcome::untrusted;
+      if (at.place.empty()) at.place = "/";
+      return at;
+    }
+    UniqueFd next(::openat(at.fd.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    if (!next.isValid()) return withError(errno);
+    struct stat facts {};
+    if (::fstat(next.get(), &facts) != 0) return withError(errno);
+    if (S_ISLNK(facts.st_mode)) {
+      if (facts.st_uid != 0) {
+        at.outcome = TrustedPath::Outcome::untrusted;
+        at.place += '/' + name;
+        return at;
+      }
+      if (++links > kMostLinks) return withError(ELOOP);
+      std::array<char, PATH_MAX> target;
+      const ssize_t size = ::readlinkat(next.get(), "", target.data(), target.size());
+      if (size <= 0) return withError(size == 0 ? ENOENT : errno);
+      const std::string_view to(target.data(), static_cast<std::size_t>(size));
+      rest = std::string(to) + rest;  // begins with a slash, or is empty
+      if (to.front() == '/' && !startAtTop()) return withError(errno);
+      continue;
+    }
+    if (name == "..") {
+      goUp(&at.place);
+    } else if (name != ".") {
+      at.place += '/' + name;
+    }
+    at.fd = std::move(next);
+    at.facts = facts;
+  }
+  if (path.ends_with('/') && !S_ISDIR(at.facts.st_mode)) return withError(ENOTDIR);
+  at.outcome = TrustedPath::Outcome::trusted;
+  if (at.place.empty()) at.place = "/";
+  return at;
+}
+
+}  // namespace brenvik
