@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <dirent.h>
 #include <fcntl.h>
+#include <grp.h>
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/file.h>
@@ -808,7 +809,7 @@ class ServiceTest : public PortsTest {
     serviceSource = sources.makeRoutineSource(service, table, WantTrailer::yes);
     ASSERT_TRUE(serviceSource->addTo(*loop));
   }
-  SystemBootstrap bootstrap() { return {ports, directory}; }
+  SystemBootstrap bootstrap() { return {ports, directory, group}; }
   UniqueFd connect() {
     UniqueFd fd(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     sockaddr_un address{};
@@ -824,19 +825,35 @@ class ServiceTest : public PortsTest {
 
   std::string root;       // of all that a test makes
   std::string directory;  // where the bootstrap makes sockets
+  std::string group = "nogroup";
   PortName service = kNullPort;
   std::shared_ptr<RoutineSource> serviceSource;
 };
 
-TEST_F(ServiceTest, TheSocketFileIsMadeForEverybodyAndGoesWithTheRight) {
+TEST_F(ServiceTest, TheSocketFileIsMadeForTheGroupAndGoesWithTheRight) {
   directory += "/a/b";
   listen();
   struct stat status {};
+  ASSERT_EQ(::stat(directory.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0755U);
   ASSERT_EQ(::stat(path().c_str(), &status), 0);
-  EXPECT_EQ(status.st_mode & 07777, 0666U);
+  EXPECT_EQ(status.st_mode & 07777, 0660U);
+  if (::geteuid() == 0) {
+    EXPECT_EQ(status.st_uid, 0U);
+    EXPECT_EQ(status.st_gid, ::getgrnam("nogroup")->gr_gid);
+  }
   serviceSource->invalidate();
   EXPECT_EQ(ports.dropReceiveRight(service), kern::success);
   EXPECT_NE(::stat(path().c_str(), &status), 0);
+}
+
+TEST_F(ServiceTest, WithoutTheGroupTheSocketFileIsForRootsAlone) {
+  group = "no-such-group";
+  listen();
+  struct stat status {};
+  ASSERT_EQ(::stat(path().c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0660U);
+  EXPECT_EQ(status.st_gid, ::getegid());
 }
 
 TEST_F(ServiceTest, AStaleSocketFileIsReplaced) {
