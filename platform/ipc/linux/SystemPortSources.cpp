@@ -117,7 +117,7 @@ class ChannelOwner {
   // Around the handler: makes sure that it finds descriptors. False: there are none, and it must not be
   // asked.
   virtual bool beginService(Channel&) noexcept { return true; }
-  // After the answer. True when the channel is to be closed.
+  // Before the answer. True when the channel is to be closed after it.
   virtual bool endService(Channel&, KernelReturn) noexcept { return false; }
   // Has the channel's next message dropped elsewhere and resumes the channel then. False when that cannot be
   // done.
@@ -317,6 +317,7 @@ void Channel::serve() noexcept {
       (reply.header().bits & kComplexBit) != 0 ? kern::success : reply.as<StatusReply>().returnCode;
   const bool isTaken = !isDoor || owner_ == nullptr || incoming_.take(fd_->get());
   if (owner_ != nullptr && outcome == Outcome::accepted) owner_->admitted(*this);
+  if (isDoor && owner_ != nullptr) endsOnResume_ = owner_->endService(*this, code);
 
   out.size = reply.header().size;
   reply.header().replyPort = kNullPort;
@@ -327,7 +328,6 @@ void Channel::serve() noexcept {
   // Only now: a routine's region or right is good until its reply is on its way.
   incoming_.release(outcome == Outcome::accepted);
   if (!isDoor || owner_ == nullptr) return;
-  endsOnResume_ = owner_->endService(*this, code);
   if (!isTaken) return discard();
   if (endsOnResume_) end();
 }
