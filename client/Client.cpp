@@ -162,7 +162,9 @@ std::int32_t Client::tryCheckIn(Deadline deadline, UniqueFd* channel) noexcept {
       return BVMH_ERROR_TIMED_OUT;
     default:
       systemError_ = errno;
-      return meansNobody(errno) ? BVMH_ERROR_UNREACHABLE : BVMH_ERROR_SYSTEM;
+      // The socket is the group's; who is not in it is refused before the helper could.
+      if (systemError_ == EACCES) return BVMH_INVALID_SECURITY;
+      return meansNobody(systemError_) ? BVMH_ERROR_UNREACHABLE : BVMH_ERROR_SYSTEM;
   }
 
   int ends[2];

@@ -111,6 +111,18 @@ TEST(ClientTest, ReportsARefusedCheckInAndStaysUnconnected) {
   EXPECT_EQ(BVMobileHelperClearVoicemailToken(client.get()), BVMH_ERROR_NOT_CONNECTED);
 }
 
+TEST(ClientTest, AnAccountThatMayNotConnectIsRefusedLikeOneThatLacksTheEntitlement) {
+  ScriptedHelper helper([](Script&) {});
+  const ClientPointer client = clientFor(helper.path());
+  ASSERT_EQ(::chmod(helper.path().c_str(), 0), 0);
+  const uid_t before = ::geteuid();
+  ASSERT_EQ(::seteuid(before == 0 ? 65534 : before), 0);  // root passes over modes
+  const std::int32_t code = bvmh_connect(client.get());
+  ASSERT_EQ(::seteuid(before), 0);
+  EXPECT_EQ(code, BVMH_INVALID_SECURITY);
+  EXPECT_EQ(bvmh_client_errno(client.get()), EACCES);
+}
+
 TEST(ClientTest, TriesAgainWhenTheHelperStopsBeforeItAnswersTheCheckIn) {
   for (const bool readsFirst : {true, false}) {
     ScriptedHelper helper([&](Script& script) {

@@ -18,6 +18,7 @@ if(CMAKE_CXX_BYTE_ORDER STREQUAL "BIG_ENDIAN")
 endif()
 
 set(BRENVIK_BOOTSTRAP_DIRECTORY "/run/brenvik/bootstrap" CACHE STRING "Socket files of named services")
+set(BRENVIK_SERVICE_GROUP "brenvik" CACHE STRING "Group that may connect to the service socket")
 set(BRENVIK_ENTITLEMENT_DIRECTORIES "/etc/brenvik/entitlements.d;/usr/lib/brenvik/entitlements.d"
     CACHE STRING "Entitlement files, earlier directories first")
 set(BRENVIK_LASD_HOST "lasd.norvale.example" CACHE STRING "Update server, HTTPS; host or host:port")

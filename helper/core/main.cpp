@@ -46,8 +46,8 @@
 namespace brenvik {
 namespace {
 
-// A client takes four descriptors; the usual limit of 1,024 would be 250 of them.
-constexpr rlim_t kDescriptors = 8192;
+// A client takes two descriptors, and its process one: 4,000 clients of as many processes, and as much again.
+constexpr rlim_t kDescriptors = 16384;
 
 void prepareProcess() noexcept {
   rlimit descriptors{};
@@ -167,7 +167,7 @@ int run() {
   SystemPortSpace ports;
   SystemRegions regions;
   SystemPortSources sources(ports, regions);
-  SystemBootstrap bootstrap(ports, BRENVIK_BOOTSTRAP_DIRECTORY);
+  SystemBootstrap bootstrap(ports, BRENVIK_BOOTSTRAP_DIRECTORY, BRENVIK_SERVICE_GROUP);
   LoadedBasebandLibrary baseband;
 
   RequestsOnFirstUse<Areas> requests([&] { return std::make_unique<Areas>(queues, regions, accounts); });

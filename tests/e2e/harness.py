@@ -6,6 +6,7 @@ Every test runs as root in a machine of its own (see the sandbox script): it may
 another account and stop the daemon it started.
 """
 import contextlib
+import grp
 import os
 import pathlib
 import plistlib
@@ -212,14 +213,15 @@ class Daemon:
 
 
 def listen(path=SOCKET):
-    """A listening socket as the service manager would make it."""
+    """A listening socket as the service manager would make it: root's and the group's."""
     path = pathlib.Path(path)
     path.parent.mkdir(parents=True, exist_ok=True)
     if path.exists():
         path.unlink()
     sock = socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET)
     sock.bind(str(path))
-    os.chmod(path, 0o666)
+    os.chown(path, 0, grp.getgrnam("brenvik").gr_gid)
+    os.chmod(path, 0o660)
     sock.listen(128)
     return sock
 
@@ -231,7 +233,7 @@ def as_account(name, work):
         status = 255
         try:
             account = pwd.getpwnam(name)
-            os.setgroups([])
+            os.initgroups(name, account.pw_gid)
             os.setresgid(account.pw_gid, account.pw_gid, account.pw_gid)
             os.setresuid(account.pw_uid, account.pw_uid, account.pw_uid)
             status = work()

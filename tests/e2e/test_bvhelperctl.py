@@ -4,8 +4,10 @@
 import datetime
 import errno
 import json
+import os
 import pathlib
 import plistlib
+import pwd
 import shutil
 import subprocess
 import tempfile
@@ -21,7 +23,7 @@ OWN_FILE = ENTITLEMENTS / "bvhelperctl.plist"
 
 def run(*arguments, account=None):
     return subprocess.run([TOOL, *arguments], capture_output=True, text=True, timeout=60, stdin=subprocess.DEVNULL,
-                          user=account, group=account, extra_groups=[] if account else None)
+                          user=account, group=account, extra_groups=os.getgrouplist(account, pwd.getpwnam(account).pw_gid) if account else None)
 
 
 class ToolTest(HelperTest):
@@ -61,6 +63,14 @@ class Admission(ToolTest):
         OWN_FILE.write_text("\n".join(line.removeprefix("  ") for line in lines[2:]) + "\n")
         OWN_FILE.chmod(0o644)
         self.expect("the helper answers\n", "ping")
+
+    def test_an_account_that_may_not_connect_is_told_about_the_group(self):
+        refused = run("ping", account="outsider")
+        self.assertEqual((refused.returncode, refused.stdout), (1, ""))
+        lines = refused.stderr.splitlines()
+        self.assertEqual(lines[0], "bvhelperctl: refused: this account may not connect to /run/brenvik/bootstrap/"
+                                   "com.norvale.brenvik.mobile-helper")
+        self.assertIn("  usermod -aG brenvik outsider", lines)
 
     def test_the_advice_names_the_account_of_the_caller(self):
         refused = run("ping", account="telephony")

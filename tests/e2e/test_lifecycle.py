@@ -1,6 +1,7 @@
 # SPDX-License-Identifier: Apache-2.0
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 """Start, refusal, idle exit: the life of the real process."""
+import grp
 import os
 import pathlib
 import plistlib
@@ -19,8 +20,19 @@ IDLE = 10.0  # seconds
 
 
 class StandingAlone(HelperTest):
-    def test_the_socket_file_is_there_for_everybody(self):
-        self.assertEqual(SOCKET.stat().st_mode & 0o7777, 0o666)
+    def test_the_socket_file_is_there_for_the_group(self):
+        facts = SOCKET.stat()
+        self.assertEqual((facts.st_uid, facts.st_gid, facts.st_mode & 0o7777), (0, grp.getgrnam("brenvik").gr_gid, 0o660))
+        self.assertEqual(SOCKET.parent.stat().st_mode & 0o7777, 0o755)
+
+    def test_who_is_not_in_the_group_is_turned_away_and_who_is_is_refused_by_entitlement(self):
+        def knock():
+            try:
+                return refused_with()
+            except PermissionError:
+                return 200
+        self.assertEqual(as_account("outsider", knock), 200)
+        self.assertEqual(as_account("stranger", knock), 35)
 
     def test_a_second_instance_says_why_and_exits_with_1(self):
         second = Daemon(wait=False)

@@ -6,6 +6,7 @@ import contextlib
 import ctypes
 import fcntl
 import glob
+import grp
 import gzip
 import http.server
 import json
@@ -287,7 +288,9 @@ def install():
     expect_equal(property_of(SOCKET, "ActiveState"), "active", SOCKET)
     expect_equal(property_of(SOCKET, "UnitFileState"), "enabled", SOCKET)
     expect_equal(property_of(SERVICE, "ActiveState"), "inactive", "nobody has asked yet")
-    expect_equal(stat.S_IMODE(os.stat(PATH).st_mode), 0o666, "mode of the socket")
+    facts = os.stat(PATH)
+    expect_equal((facts.st_uid, facts.st_gid, stat.S_IMODE(facts.st_mode)), (0, grp.getgrnam("brenvik").gr_gid, 0o660),
+                 "owner, group and mode of the socket")
     mobile = pwd.getpwnam("mobile")
     expect_equal(mobile.pw_dir, "/var/mobile")
     expect_equal(os.stat("/var/mobile").st_uid, mobile.pw_uid)
@@ -542,13 +545,17 @@ def held_in_its_sandbox():
 def other_accounts_are_told_apart():
     """Reading the executable of another account's process is what CAP_SYS_PTRACE is kept for."""
     run("useradd", "--system", "--no-create-home", "telephony")
-    done = run("setpriv", "--reuid=telephony", "--regid=telephony", "--clear-groups", "bvhelperctl", "ping", check=False)
+    done = run("setpriv", "--reuid=telephony", "--regid=telephony", "--init-groups", "bvhelperctl", "ping", check=False)
+    expect_equal(done.returncode, 1, "an account that is not in the group")
+    expect("usermod -aG brenvik telephony" in done.stderr, "what to do about it")
+    run("usermod", "-aG", "brenvik", "telephony")
+    done = run("setpriv", "--reuid=telephony", "--regid=telephony", "--init-groups", "bvhelperctl", "ping", check=False)
     expect_equal(done.returncode, 1, "another account, the same program")
     file = pathlib.Path("/etc/brenvik/entitlements.d/60-telephony.plist")
     file.write_bytes(plistlib.dumps({"Executable": "/usr/bin/bvhelperctl", "User": "telephony",
                                      "Entitlements": {"com.norvale.Teravox.BrenvikHelper.allow": True}}))
     os.chmod(file, 0o644)
-    run("setpriv", "--reuid=telephony", "--regid=telephony", "--clear-groups", "bvhelperctl", "ping")
+    run("setpriv", "--reuid=telephony", "--regid=telephony", "--init-groups", "bvhelperctl", "ping")
 
 
 def a_telephony_daemon_without_rights_lives_with_it():

@@ -99,6 +99,16 @@ std::string entitlementAdvice() {
          "bvhelperctl access shows what the entitlement files say now, step by step.";
 }
 
+// What to do when the account may not even connect.
+std::string groupAdvice() {
+  return "Only root and members of the group \"" BRENVIK_SERVICE_GROUP
+         "\" may. Let an administrator add the account, and log in anew:\n"
+         "  usermod -aG " BRENVIK_SERVICE_GROUP " " +
+         accountOfThisProcess() +
+         "\n"
+         "It then needs the entitlement, too: this command tells how.";
+}
+
 bool isTransportFailure(std::int32_t code) { return code >= BVMH_ERROR_FIRST && code <= BVMH_ERROR_LAST; }
 
 std::string socketOf(const Settings& settings) { return settings.socket.value_or(bvmh_service_socket()); }
@@ -122,6 +132,11 @@ int reportCode(const Settings& settings, bvmh_client* client, const char* routin
                   "The request may still be carried out. --timeout waits longer.", fields);
     }
     case BVMH_INVALID_SECURITY:
+      if (error == EACCES) {
+        return fail(settings, kRefused,
+                    "refused: this account may not connect to " + printable(socketOf(settings)),
+                    groupAdvice(), fields);
+      }
       return fail(settings, kRefused, "refused: " + text, entitlementAdvice(), fields);
     case BVMH_NO_ACCESS:
       return fail(settings, kRefused, "refused: " + (failure.empty() ? text : failure), "", fields);

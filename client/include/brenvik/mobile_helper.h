@@ -54,7 +54,7 @@ enum {
   BVMH_RESOURCE_SHORTAGE = 6, /* the helper is out of memory or descriptors */
   BVMH_NO_ACCESS = 8,         /* the path is outside the places that the routine may touch */
   BVMH_MEMORY_FAILURE = 9,    /* the file gave no property list */
-  BVMH_INVALID_SECURITY = 35, /* the caller lacks the entitlement */
+  BVMH_INVALID_SECURITY = 35, /* the caller lacks the entitlement, or may not even connect */
   BVMH_NOT_SUPPORTED = 46,    /* not in this build of the helper */
   BVMH_TYPE_ERROR = -300,
   BVMH_BAD_ID = -303,
@@ -113,14 +113,17 @@ BVMH_API const char* bvmh_bootstrap_directory(void);
 /*
  * Connects to the helper and checks in; it does nothing when that was done already. When the helper stopped
  * before it answered, it is tried again, for about a second and never beyond the time-out.
- * BVMH_INVALID_SECURITY: the helper refused this program. BVMH_ERROR_UNREACHABLE: no helper.
+ * BVMH_INVALID_SECURITY: the helper refused this program. With EACCES in bvmh_client_errno the kernel did: the
+ * account must join the group that may connect ("brenvik"; usermod -aG brenvik ACCOUNT), log in anew, and then be
+ * entitled. BVMH_ERROR_UNREACHABLE: no helper.
  */
 BVMH_API BVMH_CHECKED int32_t bvmh_connect(bvmh_client* client);
 /* Leaves the helper. Answers still to come are lost. */
 BVMH_API void bvmh_disconnect(bvmh_client* client);
 /* bvmh_disconnect, then bvmh_connect. */
 BVMH_API BVMH_CHECKED int32_t bvmh_reconnect(bvmh_client* client);
-/* The errno behind the last BVMH_ERROR_UNREACHABLE or BVMH_ERROR_SYSTEM of this client; else 0. */
+/* The errno behind the last BVMH_ERROR_UNREACHABLE or BVMH_ERROR_SYSTEM of this client, EACCES behind a
+ * BVMH_INVALID_SECURITY of the kernel's; else 0. */
 BVMH_API int bvmh_client_errno(const bvmh_client* client);
 
 /*

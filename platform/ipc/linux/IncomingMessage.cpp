@@ -5,6 +5,7 @@
 #include <fcntl.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
+#include <sys/vfs.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -16,6 +17,9 @@ namespace brenvik {
 namespace {
 
 constexpr int kNeededSeals = F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE;
+
+// linux/magic.h. Memory of huge pages has seals, too, but is mapped and unmapped in other units.
+constexpr auto kOrdinaryMemory = 0x01021994;
 
 bool isPortSocket(int fd) noexcept {
   int domain = AF_UNSPEC;
@@ -31,15 +35,31 @@ bool isPortSocket(int fd) noexcept {
 
 IncomingMessage::~IncomingMessage() { release(false); }
 
-IncomingMessage::Received IncomingMessage::receive(int fd) noexcept {
+IncomingMessage::Received IncomingMessage::receive(int fd) noexcept { return receive(fd, 0, kControlRoom); }
+
+IncomingMessage::Received IncomingMessage::peek(int fd, ClosingLine::Account account) noexcept {
+  const Received received = receive(fd, MSG_PEEK, kControlRoomOfAStranger);
+  peeked_ = received == Received::message;
+  account_ = account;
+  return received;
+}
+
+bool IncomingMessage::take(int fd) noexcept {
+  // One descriptor is still ours afterwards; a second one would be dropped here.
+  if (descriptorsCut_) return false;
+  (void)::recv(fd, nullptr, 0, MSG_DONTWAIT | MSG_TRUNC);
+  return true;
+}
+
+IncomingMessage::Received IncomingMessage::receive(int fd, int flags, std::size_t controlRoom) noexcept {
   release(false);
   iovec io{storage_.bytes.data(), storage_.bytes.size()};
   msghdr message{};
   message.msg_iov = &io;
   message.msg_iovlen = 1;
   message.msg_control = storage_.control.data();
-  message.msg_controllen = storage_.control.size();
-  const ssize_t size = ::recvmsg(fd, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+  message.msg_controllen = controlRoom;
+  const ssize_t size = ::recvmsg(fd, &message, flags | MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
   if (size < 0) return errno == EAGAIN ? Received::nothing : Received::endOfChannel;
 
   sender_.reset();
@@ -58,7 +78,8 @@ IncomingMessage::Received IncomingMessage::receive(int fd) noexcept {
       }
     }
   }
-  truncated_ = (message.msg_flags & (MSG_TRUNC | MSG_CTRUNC)) != 0;
+  bytesCut_ = (message.msg_flags & MSG_TRUNC) != 0;
+  descriptorsCut_ = (message.msg_flags & MSG_CTRUNC) != 0;
   length_ = static_cast<std::size_t>(size);
   if (length_ == 0) {
     release(false);
@@ -73,6 +94,8 @@ KernelReturn IncomingMessage::mapRegion(int fd, std::uint32_t length, std::uint6
   struct stat status {};
   (void)::fstat(fd, &status);  // a descriptor with seals has a size
   if (status.st_size < static_cast<off_t>(length)) return mig::badArguments;
+  struct statfs system {};
+  if (::fstatfs(fd, &system) != 0 || system.f_type != kOrdinaryMemory) return mig::badArguments;
   // Private: before Linux 6.7 a shared mapping of memory sealed against writing is refused, even for reading.
   void* const mapped = ::mmap(nullptr, length, PROT_READ, MAP_PRIVATE, fd, 0);
   if (mapped == MAP_FAILED) return kern::resourceShortage;
@@ -81,11 +104,21 @@ KernelReturn IncomingMessage::mapRegion(int fd, std::uint32_t length, std::uint6
   return kern::success;
 }
 
+KernelReturn IncomingMessage::checkForm() const noexcept {
+  if (bytesCut_) return mig::badArguments;
+  const auto walk = walkDescriptors({storage_.bytes.data(), length_});
+  if (!walk) return mig::badArguments;
+  if (!descriptorsCut_) return walk->rights == fdCount_ ? kern::success : mig::badArguments;
+  // Of a stranger's descriptors no more than one was asked for. Else there was room for all that a message
+  // may carry, so it was this process that had no descriptor left.
+  const bool areTooMany = peeked_ && fdCount_ > 0;
+  return areTooMany ? mig::badArguments : kern::resourceShortage;
+}
+
 KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
-  if (truncated_) return mig::badArguments;
+  if (const KernelReturn code = checkForm(); code != kern::success) return code;
   const std::span<const std::byte> datagram(storage_.bytes.data(), length_);
   const auto walk = walkDescriptors(datagram);
-  if (!walk || walk->rights != fdCount_) return mig::badArguments;
 
   std::size_t nextFd = 0;
   DescriptorCursor cursor(datagram, walk->messageSize);
@@ -94,7 +127,7 @@ KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
     if (descriptor->kind == WalkedDescriptor::Kind::port) {
       UniqueFd& fd = fds_[nextFd++];
       if (!isPortSocket(fd.get())) return mig::badArguments;
-      const PortName name = ports_.adoptSendRight(std::move(fd));
+      const PortName name = ports_.adoptSendRight(std::move(fd), account_);
       if (name == kNullPort) return kern::resourceShortage;
       names_[nameCount_++] = name;
       std::memcpy(at + offsetof(PortDescriptor, name), &name, sizeof name);
@@ -104,8 +137,11 @@ KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
     if (descriptor->kind == WalkedDescriptor::Kind::inLineRegion) {
       address = reinterpret_cast<std::uint64_t>(storage_.bytes.data() + descriptor->regionOffset);
     } else if (descriptor->kind == WalkedDescriptor::Kind::memfdRegion) {
-      const KernelReturn code = mapRegion(fds_[nextFd++].get(), descriptor->regionLength, &address);
+      if (peeked_) return mig::badArguments;  // nothing of a stranger's is mapped
+      UniqueFd& fd = fds_[nextFd++];
+      const KernelReturn code = mapRegion(fd.get(), descriptor->regionLength, &address);
       if (code != kern::success) return code;
+      fd.reset();  // memory: its close waits for nobody
     }
     std::memcpy(at + offsetof(OutOfLineDescriptor, address), &address, sizeof address);
   }
@@ -116,12 +152,14 @@ KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
 }
 
 void IncomingMessage::release(bool keepRights) noexcept {
-  for (std::size_t i = 0; i < fdCount_; ++i) fds_[i].reset();
+  for (std::size_t i = 0; i < fdCount_; ++i) ports_.closing().close(std::move(fds_[i]), account_);
   for (std::size_t i = 0; i < mappingCount_; ++i) ::munmap(mappings_[i].address, mappings_[i].length);
   if (!keepRights) {
     for (std::size_t i = 0; i < nameCount_; ++i) (void)ports_.deallocateSendRight(names_[i]);
   }
   fdCount_ = mappingCount_ = nameCount_ = length_ = 0;
+  peeked_ = false;
+  account_ = ClosingLine::kClients;
 }
 
 }  // namespace brenvik

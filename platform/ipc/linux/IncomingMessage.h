@@ -29,10 +29,22 @@ class IncomingMessage {
   // Takes the next datagram of a socket, without waiting: one system call.
   Received receive(int fd) noexcept;
 
+  // As receive, for a stranger's message: it stays in the socket until taken(), and of its descriptors no
+  // more than one is received. What is not a message of at most one port is refused by checkForm() and
+  // unpack().
+  Received peek(int fd, ClosingLine::Account account) noexcept;
+  // Takes the message that was peeked at off the socket. False when that would drop descriptors that nobody
+  // else holds: it is still there then, and a thread that may wait must take it (ClosingLine).
+  bool take(int fd) noexcept;
+
   // Long enough to be looked at; a shorter datagram is dropped without an answer.
   bool hasHeader() const noexcept { return length_ >= sizeof(MessageHeader); }
 
-  // Checks the framing, maps what travels as a memfd, gives names to the rights and writes both into the
+  // Whether the framing is right, and as many descriptors came as it asks for. Looks at nothing else.
+  // Precondition: hasHeader().
+  KernelReturn checkForm() const noexcept;
+
+  // Checks the form, maps what travels as a memfd, gives names to the rights and writes both into the
   // message, with its size and `localPort`. A code of the message layer when no correct sender makes such a
   // datagram, one of the kernel when this process lacks what it takes; the header is as sent then.
   // Precondition: hasHeader().
@@ -53,6 +65,8 @@ class IncomingMessage {
  private:
   // For SCM_MAX_FD rights, which is what the kernel lets one message carry, and its word on the sender.
   static constexpr std::size_t kControlRoom = CMSG_SPACE(sizeof(int) * 253) + CMSG_SPACE(sizeof(ucred));
+  // For one right: CMSG_SPACE would leave room for two.
+  static constexpr std::size_t kControlRoomOfAStranger = CMSG_SPACE(sizeof(ucred)) + CMSG_LEN(sizeof(int));
   static constexpr std::size_t kMostRights = (kControlRoom - CMSG_LEN(0)) / sizeof(int);  // that fit in there
 
   struct Mapping {
@@ -61,9 +75,14 @@ class IncomingMessage {
   };
   KernelReturn mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept;
 
+  Received receive(int fd, int flags, std::size_t controlRoom) noexcept;
+
   SystemPortSpace& ports_;
   std::size_t length_ = 0;
-  bool truncated_ = false;
+  bool peeked_ = false;
+  bool bytesCut_ = false;
+  bool descriptorsCut_ = false;
+  ClosingLine::Account account_ = ClosingLine::kClients;
   std::optional<ucred> sender_;
   std::size_t fdCount_ = 0;
   std::size_t mappingCount_ = 0;

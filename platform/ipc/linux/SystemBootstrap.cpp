@@ -3,6 +3,7 @@
 #include "platform/ipc/linux/SystemBootstrap.h"
 
 #include <fcntl.h>
+#include <grp.h>
 #include <sys/file.h>
 #include <sys/ioctl.h>
 #include <sys/socket.h>
@@ -17,9 +18,11 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
+#include <optional>
 #include <string_view>
 #include <system_error>
 #include <thread>
+#include <vector>
 
 #include "platform/log/Log.h"
 
@@ -46,6 +49,27 @@ bool isListeningPort(int fd) noexcept {
     return ::getsockopt(fd, SOL_SOCKET, option, &value, &size) == 0 && value == wanted;
   };
   return has(SO_DOMAIN, AF_UNIX) && has(SO_TYPE, SOCK_SEQPACKET) && has(SO_ACCEPTCONN, 1);
+}
+
+// The group's number; root's when there is no such group. Nothing when that cannot be found out.
+std::optional<gid_t> numberOf(const std::string& group) {
+  for (std::vector<char> room(1024);; room.resize(2 * room.size())) {
+    struct group entry {};
+    struct group* found = nullptr;
+    const int error = ::getgrnam_r(group.c_str(), &entry, room.data(), room.size(), &found);
+    if (found != nullptr) return found->gr_gid;
+    switch (error) {
+      case ERANGE:  // a group with many members
+        continue;
+      case 0:
+      case ENOENT:
+      case ESRCH:
+        return gid_t{0};
+      default:
+        errno = error;
+        return std::nullopt;
+    }
+  }
 }
 
 bool lockWithin(int fd) noexcept {
@@ -111,7 +135,16 @@ UniqueFd SystemBootstrap::fromServiceManager(const char* serviceName) {
   return chosen;
 }
 
-UniqueFd SystemBootstrap::listenAt(const std::string& path, const char* serviceName) noexcept {
+// Nobody but its owner may connect before this: bind(2) leaves out what the umask does, and the umask is 022.
+bool SystemBootstrap::openToGroup(const std::string& path) const {
+  if (::geteuid() == 0) {
+    const auto group = numberOf(group_);
+    if (!group || ::lchown(path.c_str(), 0, *group) != 0) return false;
+  }
+  return ::chmod(path.c_str(), 0660) == 0;
+}
+
+UniqueFd SystemBootstrap::listenAt(const std::string& path, const char* serviceName) {
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   if (path.size() >= sizeof address.sun_path) {
@@ -143,10 +176,9 @@ UniqueFd SystemBootstrap::listenAt(const std::string& path, const char* serviceN
   }
 
   UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-  // Anybody may ask; who is refused is decided by entitlement.
   if (!socket.isValid() ||
       ::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
-      ::chmod(path.c_str(), 0666) != 0 || ::listen(socket.get(), SOMAXCONN) != 0) {
+      !openToGroup(path) || ::listen(socket.get(), SOMAXCONN) != 0) {
     logUnified(LogLevel::error, "cannot listen at %s: %s", path.c_str(), std::strerror(errno));
     return {};
   }

@@ -11,12 +11,16 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <chrono>
 #include <cstring>
-#include <list>
 #include <new>
+#include <unordered_map>
+#include <utility>
 #include <vector>
 
+#include "platform/ipc/linux/ConnectionBooks.h"
 #include "platform/ipc/linux/MessageTrailerBuilder.h"
+#include "platform/ipc/linux/RefusalLimit.h"
 #include "platform/log/Log.h"
 
 namespace brenvik {
@@ -28,10 +32,16 @@ constexpr int kMessageBudget = 8;
 // Connections accepted in a row; the next wake-up goes on.
 constexpr int kAcceptBudget = 16;
 
-// Connections without a check-in: a client sends its check-in at once, so few are ever waiting. What one
-// account may hold is below the total, so that it cannot crowd out the others.
-constexpr std::size_t kMostUnadmitted = 128;
-constexpr std::size_t kMostUnadmittedOfOneAccount = 64;
+// What a look at a caller takes at most: folders and files of /proc and of the entitlements, and the new
+// port.
+constexpr std::size_t kReservedDescriptors = 8;
+
+// How soon what waits for descriptors, room in the closing line or an account's limit is looked at again.
+constexpr std::chrono::milliseconds kTick = RefusalLimit::kOneMoreEvery;
+
+// A reply for which the kernel has no memory is tried again, about a second in all.
+constexpr std::chrono::milliseconds kRetryPause{10};
+constexpr int kMostRetries = 100;
 
 constexpr std::size_t kLargestReply = 512;
 static_assert(kLargestReply >= kRequestLargestReply && kLargestReply >= kCheckInLargestMessage);
@@ -46,7 +56,7 @@ struct OutgoingReply {
   UniqueFd memfd;
 };
 
-enum class Sent { done, channelFull, failed };
+enum class Sent { done, channelFull, noMemory, failed };
 
 ssize_t sendOnce(int fd, OutgoingReply& reply) noexcept {
   constexpr int kFlags = MSG_DONTWAIT | MSG_NOSIGNAL;
@@ -81,9 +91,10 @@ Sent sendReply(int fd, OutgoingReply& reply) noexcept {
     sent = sendOnce(fd, reply);
   } while (sent < 0 && errno == EINTR);
   if (sent >= 0) return Sent::done;
-  // ENOBUFS and ENOMEM pass as a full channel does; ETOOMANYREFS: too many descriptors on their way already.
-  return errno == EAGAIN || errno == EWOULDBLOCK || errno == ENOBUFS || errno == ENOMEM ? Sent::channelFull
-                                                                                        : Sent::failed;
+  if (errno == EAGAIN || errno == EWOULDBLOCK) return Sent::channelFull;
+  // Not a full channel: that one becomes writable when there is room, this one says it is all the time.
+  if (errno == ENOBUFS || errno == ENOMEM) return Sent::noMemory;
+  return Sent::failed;  // ETOOMANYREFS: too many descriptors on their way already
 }
 
 class Channel;
@@ -97,29 +108,70 @@ class ChannelOwner {
   virtual PortName port() const noexcept = 0;
   virtual std::uint32_t nextSequence() noexcept = 0;
   virtual void admitted(Channel& channel) noexcept = 0;
+
+  // Whether the other ends of its channels are strangers: what they send is looked at before it is taken.
+  virtual bool isDoor() const noexcept { return false; }
+  // Of a door. Whether the channel's next message may be looked at; if not, the owner resumes the channel
+  // later.
+  virtual bool mayBeRead(Channel&) noexcept { return true; }
+  // Around the handler: makes sure that it finds descriptors. False: there are none, and it must not be
+  // asked.
+  virtual bool beginService(Channel&) noexcept { return true; }
+  // Before the answer. True when the channel is to be closed after it.
+  virtual bool endService(Channel&, KernelReturn) noexcept { return false; }
+  // Has the channel's next message dropped elsewhere and resumes the channel then. False when that cannot be
+  // done.
+  virtual bool discardMessage(Channel&) noexcept { return false; }
+
   // The channel has ended; the owner may destroy it (its own frame keeps it alive until it returns).
   virtual void ended(Channel& channel) noexcept = 0;
 };
 
 // One connected socket and the messages on it.
-class Channel : public std::enable_shared_from_this<Channel> {
+class Channel : public std::enable_shared_from_this<Channel>, public ConnectionBooks::Entry {
  public:
+  // `account`, `peer`: of the process that made the connection, when the owner is a door.
   Channel(ChannelOwner& owner, SystemPortSpace& ports, SystemRegions& regions, IncomingMessage& incoming,
-          SystemPortSpace::SharedFd fd) noexcept
-      : owner_(&owner), ports_(ports), regions_(regions), incoming_(incoming), fd_(std::move(fd)) {}
+          SystemPortSpace::SharedFd fd, uid_t account = ClosingLine::kClients, pid_t peer = 0) noexcept
+      : Entry(account),
+        owner_(&owner),
+        ports_(ports),
+        regions_(regions),
+        incoming_(incoming),
+        fd_(std::move(fd)),
+        peer_(peer) {}
   ~Channel() { close(); }
   Channel(const Channel&) = delete;
   Channel& operator=(const Channel&) = delete;
 
   bool addTo(RunLoop& loop) {
+    loop_ = &loop;
     source_ = loop.addDescriptor(fd_->get(), EPOLLIN, [this](std::uint32_t events) { ready(events); });
     return source_ != nullptr;
   }
+
+  // Stops reading, and listening to anything the peer does. Every channel that was paused is resumed or
+  // closed.
+  void pause() noexcept { source_.reset(); }
+  void resume() noexcept {
+    if (owner_ == nullptr || source_ != nullptr) return;
+    if (endsOnResume_) return end();
+    isLimited_ = false;
+    try {
+      if (addTo(*loop_)) return;
+    } catch (const std::bad_alloc&) {
+      // As without a source.
+    }
+    end();
+  }
+  bool isLimited() const noexcept { return isLimited_; }
+  const SystemPortSpace::SharedFd& descriptor() const noexcept { return fd_; }
 
   // Ends the channel without telling the owner.
   void close() noexcept {
     owner_ = nullptr;
     source_.reset();
+    retry_.reset();
     if (pending_ != nullptr) finish(*pending_);
     pending_.reset();
     fd_.reset();
@@ -127,13 +179,19 @@ class Channel : public std::enable_shared_from_this<Channel> {
 
   void ready(std::uint32_t events) noexcept {
     const auto keptAlive = shared_from_this();
-    if (pending_ != nullptr && !resume(events)) return;
+    if (pending_ != nullptr && !sendPending(events)) return;
+    const bool isDoor = owner_ != nullptr && owner_->isDoor();
     for (int taken = 0; taken < kMessageBudget && pending_ == nullptr && owner_ != nullptr; ++taken) {
-      const auto received = incoming_.receive(fd_->get());
+      if (isDoor && !owner_->mayBeRead(*this)) {
+        isLimited_ = true;
+        return pause();
+      }
+      const auto received = isDoor ? incoming_.peek(fd_->get(), account()) : incoming_.receive(fd_->get());
       if (received == IncomingMessage::Received::endOfChannel) return end();
       if (received == IncomingMessage::Received::nothing) break;
       const bool answerWanted = incoming_.hasHeader() && incoming_.header().replyPort != kNullPort;
       serve();
+      if (source_ == nullptr) return;  // paused, or ended
       // Who waits for an answer sends nothing meanwhile: looking once more would cost a system call for
       // nothing.
       if (answerWanted) break;
@@ -144,11 +202,6 @@ class Channel : public std::enable_shared_from_this<Channel> {
     }
   }
 
-  bool isAdmitted = false;
-  // Of the process that made the connection.
-  uid_t account = 0;
-  pid_t peer = 0;
-
  private:
   void end() noexcept {
     ChannelOwner* const owner = owner_;
@@ -157,18 +210,38 @@ class Channel : public std::enable_shared_from_this<Channel> {
   }
 
   // Sends the reply that waited. True when the channel may be read again.
-  bool resume(std::uint32_t events) noexcept {
+  bool sendPending(std::uint32_t events) noexcept {
     const Sent sent = sendReply(fd_->get(), *pending_);
-    if (sent == Sent::channelFull && (events & (EPOLLHUP | EPOLLERR)) == 0) return false;
+    const bool waitsOn = sent == Sent::channelFull || (sent == Sent::noMemory && --retriesLeft_ > 0);
+    if (waitsOn && (events & (EPOLLHUP | EPOLLERR)) == 0 && waitToSend(sent)) return false;
     finish(*pending_);
     pending_.reset();
+    retry_.reset();
     if (sent == Sent::done && source_->setEvents(EPOLLIN)) return true;
     end();
     return false;
   }
 
+  // Waits for what the reply needs. False when that is impossible.
+  bool waitToSend(Sent sent) noexcept {
+    if (sent != Sent::noMemory) {
+      retry_.reset();
+      return source_->setEvents(EPOLLOUT);
+    }
+    if (!source_->setEvents(0)) return false;
+    if (retry_ != nullptr) return true;
+    try {
+      retry_ = loop_->addTimer(
+          kRetryPause, kRetryPause, [this] { ready(0); }, [this] { end(); });
+    } catch (const std::bad_alloc&) {
+      return false;
+    }
+    return retry_ != nullptr;
+  }
+
   void serve() noexcept;
-  KernelReturn refusal() const noexcept;
+  void discard() noexcept;
+  Outcome serveInto(Reply& reply, std::byte* bytes) noexcept;
   void answer(OutgoingReply& reply, bool wanted) noexcept;
   bool attach(OutgoingReply& reply) noexcept;
   void finish(OutgoingReply& reply) noexcept {
@@ -183,43 +256,68 @@ class Channel : public std::enable_shared_from_this<Channel> {
   SystemRegions& regions_;
   IncomingMessage& incoming_;
   SystemPortSpace::SharedFd fd_;
+  const pid_t peer_;
+  RunLoop* loop_ = nullptr;
   std::unique_ptr<DescriptorSource> source_;
   std::unique_ptr<OutgoingReply> pending_;
+  std::unique_ptr<LoopSource> retry_;  // while the kernel has no memory for the reply
+  int retriesLeft_ = 0;
+  bool endsOnResume_ = false;
+  bool isLimited_ = false;  // paused by mayBeRead
 };
 
-void Channel::serve() noexcept {
-  if (!incoming_.hasHeader()) return incoming_.release(false);  // dropped without an answer
+// Serves the message, as far as its form allows. Rights and regions are the message's own until it is
+// released.
+Outcome Channel::serveInto(Reply& reply, std::byte* bytes) noexcept {
+  const auto refuse = [&reply](KernelReturn code) {
+    reply.setStatus(code);
+    return Outcome::refused;
+  };
+  RoutineTable::Handler handler = nullptr;
+  if (owner_->isDoor()) {
+    // The form first: what a stranger sends along is looked at when it belongs to a message that is known.
+    if (const KernelReturn code = incoming_.checkForm(); code != kern::success) return refuse(code);
+    handler = owner_->table().find(incoming_.header().id);
+    if (handler == nullptr) return refuse(mig::badId);
+  }
+  if (const KernelReturn code = incoming_.unpack(owner_->port()); code != kern::success) return refuse(code);
+  if (handler == nullptr) handler = owner_->table().find(incoming_.header().id);
+  if (handler == nullptr) return refuse(mig::badId);
+  if (!owner_->beginService(*this)) return refuse(kern::resourceShortage);
+  const bool wantsTrailer = owner_->wantTrailer() == WantTrailer::yes && incoming_.sender();
+  if (wantsTrailer && pinPeer(fd_->get(), peer_, incoming_.sender()->pid) == PeerPin::refused) {
+    return refuse(kern::invalidSecurity);
+  }
+  const MessageTrailer trailer =
+      wantsTrailer ? buildTrailer(*incoming_.sender(), owner_->nextSequence()) : minimalTrailer();
+  try {
+    return handler(owner_->table().context(), Request(incoming_.bytes(), incoming_.header().size, &trailer),
+                   reply);
+  } catch (...) {
+    // Memory ran out in a routine: this request fails, the process goes on.
+    std::memset(bytes, 0, kRequestLargestReply);
+    return refuse(kern::resourceShortage);
+  }
+}
 
-  const KernelReturn unpacked = incoming_.unpack(owner_->port());
-  const MessageHeader request = incoming_.header();
+void Channel::serve() noexcept {
+  const bool isDoor = owner_->isDoor();
+  if (!incoming_.hasHeader()) {  // dropped without an answer
+    const bool isTaken = !isDoor || incoming_.take(fd_->get());
+    incoming_.release(false);
+    return isTaken ? void() : discard();
+  }
+
   OutgoingReply out;
   std::memset(out.bytes.data(), 0, kRequestLargestReply);
   Reply reply(out.bytes.data());
-  Outcome outcome = Outcome::refused;
-
-  const RoutineTable::Handler handler =
-      unpacked == kern::success ? owner_->table().find(request.id) : nullptr;
-  if (unpacked != kern::success) {
-    reply.setStatus(unpacked);
-  } else if (handler == nullptr) {
-    reply.setStatus(mig::badId);
-  } else if (owner_->wantTrailer() == WantTrailer::yes && incoming_.sender() &&
-             pinPeer(fd_->get(), peer, incoming_.sender()->pid) == PeerPin::refused) {
-    reply.setStatus(kern::invalidSecurity);
-  } else {
-    const MessageTrailer trailer = owner_->wantTrailer() == WantTrailer::yes && incoming_.sender()
-                                       ? buildTrailer(*incoming_.sender(), owner_->nextSequence())
-                                       : minimalTrailer();
-    try {
-      outcome = handler(owner_->table().context(), Request(incoming_.bytes(), request.size, &trailer), reply);
-    } catch (...) {
-      // Memory ran out in a routine: this request fails, the process goes on.
-      std::memset(out.bytes.data(), 0, kRequestLargestReply);
-      reply.setStatus(kern::resourceShortage);
-      outcome = Outcome::refused;
-    }
-    if (owner_ != nullptr && outcome == Outcome::accepted) owner_->admitted(*this);
-  }
+  const Outcome outcome = serveInto(reply, out.bytes.data());
+  const MessageHeader request = incoming_.header();
+  const KernelReturn code =
+      (reply.header().bits & kComplexBit) != 0 ? kern::success : reply.as<StatusReply>().returnCode;
+  const bool isTaken = !isDoor || owner_ == nullptr || incoming_.take(fd_->get());
+  if (owner_ != nullptr && outcome == Outcome::accepted) owner_->admitted(*this);
+  if (isDoor && owner_ != nullptr) endsOnResume_ = owner_->endService(*this, code);
 
   out.size = reply.header().size;
   reply.header().replyPort = kNullPort;
@@ -229,6 +327,17 @@ void Channel::serve() noexcept {
   answer(out, request.replyPort != kNullPort && owner_ != nullptr);
   // Only now: a routine's region or right is good until its reply is on its way.
   incoming_.release(outcome == Outcome::accepted);
+  if (!isDoor || owner_ == nullptr) return;
+  if (!isTaken) return discard();
+  if (endsOnResume_) end();
+}
+
+// Answered, and still in the socket: it is dropped where nobody waits for that.
+void Channel::discard() noexcept {
+  // A reply that waits would wait in vain, for the channel is not listened to.
+  endsOnResume_ = endsOnResume_ || pending_ != nullptr;
+  pause();
+  if (!owner_->discardMessage(*this)) end();
 }
 
 // Turns the names and addresses of the reply into what travels. False when the kernel refused a descriptor.
@@ -240,6 +349,8 @@ bool Channel::attach(OutgoingReply& reply) noexcept {
   if (descriptor.type == kPortDescriptorType) {
     auto& port = reinterpret_cast<CheckInReply*>(reply.bytes.data())->servicePort;
     reply.right = ports_.sendEnd(port.name);
+    // The copy on its way is all that is needed: two descriptors a client, not three.
+    ports_.sendRightHasLeft(port.name);
     port.name = kNullPort;  // names mean nothing to another process
     return reply.right != nullptr;
   }
@@ -268,17 +379,15 @@ void Channel::answer(OutgoingReply& reply, bool wanted) noexcept {
     reply.size = sizeof(StatusReply);
   }
   if (!wanted) return finish(reply);
-  switch (sendReply(fd_->get(), reply)) {
-    case Sent::done:
-      return finish(reply);
-    case Sent::failed:
-      finish(reply);
-      return end();
-    case Sent::channelFull:
-      break;
+  const Sent sent = sendReply(fd_->get(), reply);
+  if (sent == Sent::done) return finish(reply);
+  if (sent == Sent::failed) {
+    finish(reply);
+    return end();
   }
+  retriesLeft_ = kMostRetries;
   pending_.reset(new (std::nothrow) OutgoingReply(std::move(reply)));
-  if (pending_ == nullptr || !source_->setEvents(EPOLLOUT)) {
+  if (pending_ == nullptr || !waitToSend(sent)) {
     if (pending_ == nullptr) finish(reply);
     end();
   }
@@ -324,7 +433,7 @@ class PortSource final : public RoutineSource, private ChannelOwner {
   std::shared_ptr<Channel> channel_;
 };
 
-// Serves a listening socket and the connections made to it.
+// Serves a listening socket and the connections made to it: the door.
 class ServiceSource final : public RoutineSource, private ChannelOwner {
  public:
   ServiceSource(PortName port, const RoutineTable& table, WantTrailer trailer, SystemPortSpace& ports,
@@ -342,7 +451,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   bool addTo(RunLoop& loop) noexcept override {
     try {
       loop_ = &loop;
-      keepSpare();
+      (void)keepReserve();
       source_ = loop.addDescriptor(listening_->get(), EPOLLIN, [this](std::uint32_t) { acceptReady(); });
       return source_ != nullptr;
     } catch (const std::bad_alloc&) {
@@ -351,9 +460,14 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   }
   void invalidate() noexcept override {
     source_.reset();
-    spare_.reset();
-    for (const auto& channel : channels_) channel->close();
-    channels_.clear();
+    discardedSource_.reset();
+    tick_.reset();
+    discarding_.clear();
+    reserve_ = {};
+    for (const auto& [raw, channel] : std::exchange(channels_, {})) {
+      books_.remove(*channel);
+      channel->close();
+    }
   }
 
  private:
@@ -361,24 +475,99 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   WantTrailer wantTrailer() const noexcept override { return trailer_; }
   PortName port() const noexcept override { return port_; }
   std::uint32_t nextSequence() noexcept override { return sequence_++; }
-  void admitted(Channel& channel) noexcept override { channel.isAdmitted = true; }
+  bool isDoor() const noexcept override { return true; }
+  void admitted(Channel& channel) noexcept override {
+    books_.admit(channel);
+    drop(books_.overdueAdmitted());
+  }
   void ended(Channel& channel) noexcept override {
-    channels_.remove_if(
-        [&channel](const std::shared_ptr<Channel>& other) { return other.get() == &channel; });
+    books_.remove(channel);
+    channels_.erase(&channel);
+  }
+
+  bool mayBeRead(Channel& channel) noexcept override {
+    if (refusals_.allows(channel.account(), std::chrono::steady_clock::now())) return true;
+    hasLimited_ = true;
+    return !startTicking();  // without a timer nobody would resume it
+  }
+
+  // The handler gets the reserve, so that it never takes a lack of descriptors for an answer.
+  bool beginService(Channel& channel) noexcept override {
+    while (!keepReserve()) {
+      ConnectionBooks::Entry* const oldest = books_.oldestStranger();
+      if (oldest == &channel || !drop(oldest)) return false;
+    }
+    reserve_ = {};
+    return true;
+  }
+
+  bool endService(Channel& channel, KernelReturn code) noexcept override {
+    if (code == kern::invalidSecurity) {
+      refusals_.refused(channel.account(), std::chrono::steady_clock::now());
+    }
+    if (code != kern::resourceShortage) {
+      (void)keepReserve();
+      return false;
+    }
+    logUnified(LogLevel::error, "out of descriptors or memory: a check-in was refused");
+    return true;
+  }
+
+  bool discardMessage(Channel& channel) noexcept override {
+    try {
+      const std::uint64_t token = ++lastToken_;
+      discarding_.emplace(token, channel.weak_from_this());
+      reserve_ = {};  // the first one takes a descriptor
+      const bool isInLine = ports_.closing().discardMessage(channel.descriptor(), channel.account(), token);
+      if (isInLine && discardedSource_ == nullptr) {
+        discardedSource_ = loop_->addDescriptor(ports_.closing().readable(), EPOLLIN,
+                                                [this](std::uint32_t) { resumeDiscarded(); });
+      }
+      (void)keepReserve();
+      if (isInLine && discardedSource_ != nullptr) return true;
+      discarding_.erase(token);
+      return false;
+    } catch (const std::bad_alloc&) {
+      return false;
+    }
+  }
+
+  void resumeDiscarded() {
+    for (const std::uint64_t token : ports_.closing().takeDiscarded()) {
+      const auto entry = discarding_.extract(token);
+      if (entry.empty()) continue;
+      if (const auto channel = entry.mapped().lock()) channel->resume();
+    }
   }
 
   void acceptReady() noexcept {
-    acceptWaiting();
-    keepSpare();
+    const bool isOpen = acceptWaiting();
+    if (source_ == nullptr) return;  // invalidated by what it served
+    if (!keepReserve() || !isOpen) pauseAccepting();
   }
 
-  // Any descriptor will do: what counts is its place.
-  void keepSpare() noexcept {
-    if (!spare_.isValid()) spare_.reset(::fcntl(listening_->get(), F_DUPFD_CLOEXEC, 0));
+  // Any descriptor will do: what counts is its place. All or nothing; false when there are too few.
+  bool keepReserve() noexcept {
+    for (UniqueFd& place : reserve_) {
+      if (!place.isValid()) place.reset(::fcntl(listening_->get(), F_DUPFD_CLOEXEC, 0));
+      if (!place.isValid()) return false;
+    }
+    return true;
   }
 
-  void acceptWaiting() noexcept {
-    for (int i = 0; i < kAcceptBudget; ++i) {
+  // False when nobody can be let in now.
+  bool acceptWaiting() noexcept {
+    for (int i = 0; i < kAcceptBudget && source_ != nullptr; ++i) {
+      // A stranger can leave two things to be closed, a message and what it carries. While that many find no
+      // room in the line, nobody is let in: what is there could be neither kept nor closed.
+      if (!ports_.closing().hasRoomFor(2 * (books_.strangers() + 1))) {
+        if (!std::exchange(isFullTold_, true)) {
+          logUnified(LogLevel::error,
+                     "too many descriptors of refused callers wait to be closed: new clients wait");
+        }
+        return false;
+      }
+      isFullTold_ = false;
       UniqueFd connection(::accept4(listening_->get(), nullptr, nullptr, SOCK_CLOEXEC));
       if (connection.isValid()) {
         try {
@@ -389,19 +578,17 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
         continue;
       }
       if (errno == EINTR || errno == ECONNABORTED) continue;
-      if (errno != EMFILE && errno != ENFILE) return;
-      makeRoom();
+      if (errno != EMFILE && errno != ENFILE) return true;
+      // A stranger gives its place up, or else the reserve does: then this one gets an answer at least.
+      if (drop(books_.oldestStranger())) continue;
+      if (!reserve_.front().isValid()) return false;
+      reserve_ = {};
     }
+    return true;
   }
 
-  // Out of descriptors: the connection at the head of the queue would wake us for ever. An idle connection is
-  // given up for it, or the spare descriptor takes it, only to close it.
-  void makeRoom() noexcept {
-    if (closeOldestOfBusiestAccount(1)) return;
-    spare_.reset();
-    const UniqueFd refused(::accept4(listening_->get(), nullptr, nullptr, SOCK_CLOEXEC));
-    logUnified(LogLevel::error, "out of descriptors: a connection was closed unserved");
-  }
+  // The connection at the head of the queue would wake us for ever.
+  void pauseAccepting() noexcept { isAcceptingPaused_ = startTicking() && source_->setEvents(0); }
 
   void serve(UniqueFd connection) {
     // A connection made before the listening socket asked for credentials (a client that started this
@@ -415,45 +602,55 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
     (void)::getsockopt(connection.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size);
     const auto channel =
         std::make_shared<Channel>(static_cast<ChannelOwner&>(*this), ports_, regions_, incoming_,
-                                  std::make_shared<const UniqueFd>(std::move(connection)));
-    channel->account = peer.uid;
-    channel->peer = peer.pid;
+                                  ports_.share(std::move(connection), peer.uid), peer.uid, peer.pid);
     if (!channel->addTo(*loop_)) return;
-    channels_.push_back(channel);
-    const auto unadmitted = [](const std::shared_ptr<Channel>& other) { return !other->isAdmitted; };
-    const auto sameAccount = [&](const std::shared_ptr<Channel>& other) {
-      return !other->isAdmitted && other->account == peer.uid;
-    };
-    if (static_cast<std::size_t>(std::count_if(channels_.begin(), channels_.end(), sameAccount)) >
-            kMostUnadmittedOfOneAccount ||
-        static_cast<std::size_t>(std::count_if(channels_.begin(), channels_.end(), unadmitted)) >
-            kMostUnadmitted) {
-      (void)closeOldestOfBusiestAccount(2);
+    channels_.emplace(channel.get(), channel);
+    try {
+      books_.add(*channel);
+    } catch (const std::bad_alloc&) {
+      channels_.erase(channel.get());
+      throw;
     }
+    drop(books_.overdueAfter(*channel));
     // Its check-in is most often there already, and then needs no wake-up of its own.
     channel->ready(EPOLLIN);
   }
 
-  // Of the account with most connections that have not checked in, closes the oldest. False when no account
-  // has at least `atLeast` of them.
-  bool closeOldestOfBusiestAccount(std::size_t atLeast) noexcept {
-    std::shared_ptr<Channel> oldest;
-    std::size_t most = 0;
-    for (const auto& candidate : channels_) {
-      if (candidate->isAdmitted) continue;
-      const auto count = static_cast<std::size_t>(
-          std::count_if(channels_.begin(), channels_.end(), [&](const std::shared_ptr<Channel>& other) {
-            return !other->isAdmitted && other->account == candidate->account;
-          }));
-      if (count > most) {
-        most = count;
-        oldest = candidate;
-      }
-    }
-    if (oldest == nullptr || most < atLeast) return false;
-    channels_.remove(oldest);
-    oldest->close();
+  // Closes a connection, if there is one to be closed.
+  bool drop(ConnectionBooks::Entry* entry) noexcept {
+    if (entry == nullptr) return false;
+    const auto found = channels_.find(static_cast<Channel*>(entry));
+    const std::shared_ptr<Channel> channel = found->second;
+    ended(*channel);
+    channel->close();
     return true;
+  }
+
+  bool startTicking() noexcept {
+    if (tick_ != nullptr) return true;
+    try {
+      tick_ = loop_->addTimer(
+          kTick, kTick, [this] { tick(); }, [] {});
+    } catch (const std::bad_alloc&) {
+      return false;
+    }
+    return tick_ != nullptr;
+  }
+
+  // Looks again at what waits; it waits on, and is looked at with the next tick, when it must.
+  void tick() {
+    const auto self = std::move(tick_);  // the handler that runs
+    if (std::exchange(hasLimited_, false)) {
+      std::vector<std::shared_ptr<Channel>> waiting;
+      for (const auto& [raw, channel] : channels_) {
+        if (channel->isLimited()) waiting.push_back(channel);
+      }
+      for (const auto& channel : waiting) channel->resume();
+    }
+    if (std::exchange(isAcceptingPaused_, false)) {
+      (void)source_->setEvents(EPOLLIN);
+      acceptReady();
+    }
   }
 
   const PortName port_;
@@ -463,10 +660,19 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   SystemRegions& regions_;
   IncomingMessage& incoming_;
   const SystemPortSpace::SharedFd listening_;
-  UniqueFd spare_;
+  std::array<UniqueFd, kReservedDescriptors> reserve_;
   RunLoop* loop_ = nullptr;
   std::unique_ptr<DescriptorSource> source_;
-  std::list<std::shared_ptr<Channel>> channels_;  // oldest first
+  std::unique_ptr<DescriptorSource> discardedSource_;
+  std::unique_ptr<LoopSource> tick_;  // while something waits for it
+  bool hasLimited_ = false;
+  bool isFullTold_ = false;
+  bool isAcceptingPaused_ = false;
+  RefusalLimit refusals_;
+  ConnectionBooks books_;
+  std::unordered_map<Channel*, std::shared_ptr<Channel>> channels_;
+  std::unordered_map<std::uint64_t, std::weak_ptr<Channel>> discarding_;
+  std::uint64_t lastToken_ = 0;
   std::uint32_t sequence_ = 0;
 };
 

@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/ipc/linux/SystemPortSpace.h"
 
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -10,6 +11,50 @@
 #include <new>
 
 namespace brenvik {
+namespace {
+
+// Whether a socket that can receive nothing any more holds no message either, so that its close drops
+// nothing.
+bool isDrained(int socket) noexcept {
+  // With credentials asked for, an empty message is told from the end of the channel.
+  const int on = 1;
+  if (::setsockopt(socket, SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0) return false;
+  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(ucred))> control{};
+  msghdr message{};
+  message.msg_control = control.data();
+  message.msg_controllen = control.size();
+  const ssize_t size = ::recvmsg(socket, &message, MSG_PEEK | MSG_DONTWAIT);
+  return size == 0 && message.msg_flags == 0 && message.msg_controllen == 0;
+}
+
+bool hasHungUp(int socket) noexcept {
+  pollfd state{socket, 0, 0};
+  return ::poll(&state, 1, 0) == 1 && (state.revents & POLLHUP) != 0;
+}
+
+// Without a line it is closed here: the process ends, or this is the line's own thread.
+void closeIn(const std::weak_ptr<ClosingLine>& line, UniqueFd descriptor, ClosingLine::Account account) {
+  if (const auto alive = line.lock()) alive->close(std::move(descriptor), account);
+}
+
+}  // namespace
+
+SystemPortSpace::SharedFd SystemPortSpace::share(UniqueFd socket, Account account) {
+  return SharedFd(new UniqueFd(std::move(socket)), [line = weakLine(), account](const UniqueFd* given) {
+    const std::unique_ptr<UniqueFd> owned(const_cast<UniqueFd*>(given));
+    // Nobody else holds it, so nothing is put into it once it is shut, and most are empty then.
+    (void)::shutdown(owned->get(), SHUT_RDWR);
+    if (!isDrained(owned->get())) closeIn(line, std::move(*owned), account);
+  });
+}
+
+SystemPortSpace::SharedFd SystemPortSpace::shareForeign(UniqueFd descriptor, Account account) {
+  return SharedFd(new UniqueFd(std::move(descriptor)), [line = weakLine(), account](const UniqueFd* given) {
+    const std::unique_ptr<UniqueFd> owned(const_cast<UniqueFd*>(given));
+    // In most cases the other end is gone, and nothing can be put in any more.
+    if (!hasHungUp(owned->get()) || !isDrained(owned->get())) closeIn(line, std::move(*owned), account);
+  });
+}
 
 // Names count up and wrap after four thousand million: a freed name is not met again soon.
 PortName SystemPortSpace::unusedName() noexcept {
@@ -45,7 +90,7 @@ KernelReturn SystemPortSpace::allocateReceiveRight(PortName* name) noexcept {
   UniqueFd receive(ends[0]);
   UniqueFd peer(ends[1]);
   try {
-    auto shared = std::make_shared<const UniqueFd>(std::move(receive));
+    auto shared = share(std::move(receive), ClosingLine::kClients);
     Port* const port = insert(name);
     if (port == nullptr) return kern::resourceShortage;
     port->receive = std::move(shared);
@@ -63,7 +108,9 @@ KernelReturn SystemPortSpace::insertSendRight(PortName name) noexcept {
   Port& port = found->second;
   if (port.receiveReferences == 0 || port.service) return kern::invalidRight;
   if (port.send == nullptr) {
+    if (!port.peer.isValid()) return kern::invalidRight;  // it has left
     try {
+      // Its messages are our own, and its holder uses the same socket: an ordinary close.
       port.send = std::make_shared<const UniqueFd>(std::move(port.peer));
     } catch (const std::bad_alloc&) {
       return kern::resourceShortage;
@@ -105,7 +152,8 @@ KernelReturn SystemPortSpace::deallocateSendRight(PortName name) noexcept {
 
 PortName SystemPortSpace::adoptService(UniqueFd listening, std::string socketFile) noexcept {
   try {
-    auto shared = std::make_shared<const UniqueFd>(std::move(listening));
+    // Closing it drops what was sent over connections that nobody has accepted.
+    auto shared = shareForeign(std::move(listening), ClosingLine::kClients);
     PortName name = kNullPort;
     Port* const port = insert(&name);
     if (port == nullptr) return kNullPort;
@@ -121,9 +169,9 @@ PortName SystemPortSpace::adoptService(UniqueFd listening, std::string socketFil
   }
 }
 
-PortName SystemPortSpace::adoptSendRight(UniqueFd end) noexcept {
+PortName SystemPortSpace::adoptSendRight(UniqueFd end, Account account) noexcept {
   try {
-    auto shared = std::make_shared<const UniqueFd>(std::move(end));
+    auto shared = shareForeign(std::move(end), account);
     PortName name = kNullPort;
     Port* const port = insert(&name);
     if (port == nullptr) return kNullPort;
@@ -133,6 +181,11 @@ PortName SystemPortSpace::adoptSendRight(UniqueFd end) noexcept {
   } catch (const std::bad_alloc&) {
     return kNullPort;
   }
+}
+
+void SystemPortSpace::sendRightHasLeft(PortName name) noexcept {
+  const auto found = ports_.find(name);
+  if (found != ports_.end() && found->second.receiveReferences > 0) found->second.send.reset();
 }
 
 SystemPortSpace::SharedFd SystemPortSpace::receiveEnd(PortName name) const noexcept {

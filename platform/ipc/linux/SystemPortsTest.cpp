@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <dirent.h>
 #include <fcntl.h>
+#include <grp.h>
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/file.h>
@@ -26,6 +27,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/ipc/linux/MessageTrailerBuilder.h"
 #include "platform/ipc/linux/SystemBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
@@ -45,6 +47,11 @@ std::function<void()> beforeLocking;  // what happens before a file is locked
 extern "C" int flock(int fd, int operation) noexcept {
   if (brenvik::beforeLocking != nullptr) brenvik::beforeLocking();
   return static_cast<int>(::syscall(SYS_flock, fd, operation));
+}
+
+extern "C" ssize_t send(int fd, const void* bytes, size_t size, int flags) {
+  if (brenvik::FailingCall::failsNow("send")) return -1;
+  return ::sendto(fd, bytes, size, flags, nullptr, 0);
 }
 
 namespace brenvik {
@@ -114,6 +121,7 @@ class TestTable final : public RoutineTable {
   MessageTrailer trailer{};
   PortName arrivedOn = 0;
   PortName given = 0;
+  KernelReturn refuseWith = kern::failure;
   std::function<void()> whileServing;
 
  private:
@@ -167,7 +175,7 @@ class TestTable final : public RoutineTable {
         reply.setStatus(0);
         return Outcome::accepted;
       case kRefuse:
-        reply.setStatus(kern::failure);
+        reply.setStatus(self.refuseWith);
         return Outcome::refused;
       case kThrow:
         throw std::bad_alloc();
@@ -369,6 +377,7 @@ TEST_F(PortsTest, AMessageShorterThanAHeaderIsDroppedInSilenceAndItsDescriptorsA
     datagram.fds = {client.get()};
     EXPECT_FALSE(exchange(datagram)) << size;
   }
+  ports.closing().drain();
   EXPECT_EQ(openDescriptors(), before);
   EXPECT_EQ(codeOf(message(kEcho)), 0) << "the channel goes on";
 }
@@ -487,7 +496,18 @@ TEST_F(PortsTest, AMemfdMustBeSealedAndAsLongAsItSays) {
   refused(UniqueFd(::open("/dev/zero", O_RDONLY | O_CLOEXEC)), 3);
   refused(std::move(pair().first), 3);
   EXPECT_EQ(table.served, 0);
+  ports.closing().drain();
   EXPECT_EQ(openDescriptors(), before);
+}
+
+// Its mapping is a multiple of a huge page long, and could not be taken away by the region's own length.
+TEST_F(PortsTest, SealedMemoryOfHugePagesIsNoRegion) {
+  const UniqueFd huge(::memfd_create("test", MFD_CLOEXEC | MFD_ALLOW_SEALING | MFD_HUGETLB));
+  if (!huge.isValid() || ::ftruncate(huge.get(), off_t{1} << 30) != 0) GTEST_SKIP() << "no huge pages here";
+  ASSERT_EQ(::fcntl(huge.get(), F_ADD_SEALS, F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE), 0);
+  Datagram datagram = complexMessage(kEcho, 1, 44).add(region(0, 3));
+  datagram.fds = {huge.get()};
+  EXPECT_EQ(codeOf(datagram), -304);
 }
 
 TEST_F(PortsTest, MoreOrFewerDescriptorsThanTheWalkAsksForAreRefusedAndClosed) {
@@ -504,6 +524,7 @@ TEST_F(PortsTest, MoreOrFewerDescriptorsThanTheWalkAsksForAreRefusedAndClosed) {
   Datagram many = none;
   many.fds.assign(253, sealed.get());
   EXPECT_EQ(codeOf(many), -304);
+  ports.closing().drain();
   EXPECT_EQ(openDescriptors(), before);
   EXPECT_EQ(table.served, 0);
 }
@@ -535,6 +556,7 @@ TEST_F(PortsTest, ARightMustBeASeqpacketSocketOfTheUnixFamily) {
   refused(UniqueFd(::open("/dev/null", O_RDONLY | O_CLOEXEC)));
   refused(memfd("x"));
   EXPECT_EQ(table.served, 0);
+  ports.closing().drain();
   EXPECT_EQ(openDescriptors(), before);
   EXPECT_EQ(ports.size(), 1U);
 }
@@ -555,6 +577,7 @@ TEST_F(PortsTest, ARightThatTheRoutineTookOverIsKeptAndOneOfARefusedRequestIsRel
   EXPECT_EQ(ports.size(), 2U);
   sent.reset();
   ports.deallocateSendRight(table.names.at(0));
+  ports.closing().drain();
   pollfd hungUp{kept.get(), POLLIN, 0};
   EXPECT_EQ(::poll(&hungUp, 1, 0), 1) << "nobody holds the other end any more";
 }
@@ -570,7 +593,9 @@ TEST_F(PortsTest, ACheckInReplyCarriesACopyOfTheSendRight) {
   EXPECT_EQ(reply.servicePort.name, 0U);
   EXPECT_EQ(reply.servicePort.disposition, 19);
   ASSERT_EQ(answer->fds.size(), 1U);
-  EXPECT_NE(ports.sendEnd(other), nullptr) << "the helper keeps its own";
+  EXPECT_EQ(ports.sendEnd(other), nullptr) << "the helper keeps the name alone";
+  EXPECT_EQ(ports.deallocateSendRight(other), kern::success);
+  EXPECT_EQ(ports.insertSendRight(other), kern::invalidRight);
   const auto second = sources.makeRoutineSource(other, table, WantTrailer::no);
   ASSERT_TRUE(second->addTo(*loop));
   ASSERT_TRUE(sendTo(answer->fds[0].get(), message(kEcho)));
@@ -644,6 +669,30 @@ TEST_F(PortsTest, AFullChannelDelaysItsOwnRepliesOnlyAndIsNotReadUntilTheyHaveGo
   }
   EXPECT_EQ(answers, sent) << "every reply came in the end";
   EXPECT_EQ(regions.live(), 0U);
+}
+
+TEST_F(PortsTest, AReplyForWhichTheKernelHasNoMemoryGoesOutLaterAndNobodySpinsMeanwhile) {
+  for (const int error : {ENOBUFS, ENOMEM}) {
+    const FailingCall noMemory("send", error, 0, FailingCall::HowOften::once);
+    EXPECT_FALSE(exchange(message(kEcho)));
+    EXPECT_EQ(noMemory.failures(), 1);
+    EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::timedOut)
+        << "the channel has room all the time";
+    EXPECT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);
+    const auto answer = receiveFrom(client.get());
+    ASSERT_TRUE(answer);
+    EXPECT_EQ(answer->code(), 0);
+    EXPECT_EQ(codeOf(message(kEcho)), 0) << "the channel is read again";
+  }
+}
+
+TEST_F(PortsTest, AReplyForWhichTheKernelNeverHasMemoryEndsItsChannelAfterASecond) {
+  ASSERT_EQ(ports.deallocateSendRight(port), kern::success);  // the client's copy is the only one
+  const FailingCall noMemory("send", ENOMEM, 0, FailingCall::HowOften::always);
+  EXPECT_FALSE(exchange(message(kRegion).add(kNdrRecord).add(100U)));
+  EXPECT_EQ(regions.live(), 1U);
+  while (regions.live() > 0) ASSERT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);
+  EXPECT_EQ(noMemory.failures(), 1 + 100);
 }
 
 TEST_F(PortsTest, InvalidatingASourceReleasesTheReplyThatWaited) {
@@ -760,7 +809,7 @@ class ServiceTest : public PortsTest {
     serviceSource = sources.makeRoutineSource(service, table, WantTrailer::yes);
     ASSERT_TRUE(serviceSource->addTo(*loop));
   }
-  SystemBootstrap bootstrap() { return {ports, directory}; }
+  SystemBootstrap bootstrap() { return {ports, directory, group}; }
   UniqueFd connect() {
     UniqueFd fd(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     sockaddr_un address{};
@@ -776,19 +825,35 @@ class ServiceTest : public PortsTest {
 
   std::string root;       // of all that a test makes
   std::string directory;  // where the bootstrap makes sockets
+  std::string group = "nogroup";
   PortName service = kNullPort;
   std::shared_ptr<RoutineSource> serviceSource;
 };
 
-TEST_F(ServiceTest, TheSocketFileIsMadeForEverybodyAndGoesWithTheRight) {
+TEST_F(ServiceTest, TheSocketFileIsMadeForTheGroupAndGoesWithTheRight) {
   directory += "/a/b";
   listen();
   struct stat status {};
+  ASSERT_EQ(::stat(directory.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0755U);
   ASSERT_EQ(::stat(path().c_str(), &status), 0);
-  EXPECT_EQ(status.st_mode & 07777, 0666U);
+  EXPECT_EQ(status.st_mode & 07777, 0660U);
+  if (::geteuid() == 0) {
+    EXPECT_EQ(status.st_uid, 0U);
+    EXPECT_EQ(status.st_gid, ::getgrnam("nogroup")->gr_gid);
+  }
   serviceSource->invalidate();
   EXPECT_EQ(ports.dropReceiveRight(service), kern::success);
   EXPECT_NE(::stat(path().c_str(), &status), 0);
+}
+
+TEST_F(ServiceTest, WithoutTheGroupTheSocketFileIsForRootsAlone) {
+  group = "no-such-group";
+  listen();
+  struct stat status {};
+  ASSERT_EQ(::stat(path().c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0660U);
+  EXPECT_EQ(status.st_gid, ::getegid());
 }
 
 TEST_F(ServiceTest, AStaleSocketFileIsReplaced) {
@@ -1082,30 +1147,222 @@ TEST_F(ServiceTest, AnAdmittedConnectionIsNotGivenUpForOthers) {
   EXPECT_FALSE(isClosed(admitted));
 }
 
-TEST_F(ServiceTest, RunningOutOfDescriptorsNeitherKillsAcceptNorSpins) {
-  listen();
-  const UniqueFd waiting = connect();
-  rlimit old{};
-  ::getrlimit(RLIMIT_NOFILE, &old);
-  std::vector<UniqueFd> fillers;
-  const rlimit tight{std::min<rlim_t>(old.rlim_max, 256), old.rlim_max};
-  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &tight), 0);
-  for (;;) {
-    UniqueFd filler(::dup(0));
-    if (!filler.isValid()) break;
-    fillers.push_back(std::move(filler));
+// Takes every descriptor that this process may have, and gives `count` back.
+class DescriptorShortage {
+ public:
+  explicit DescriptorShortage(std::size_t count) {
+    ::getrlimit(RLIMIT_NOFILE, &before_);
+    const rlimit tight{std::min<rlim_t>(before_.rlim_max, 256), before_.rlim_max};
+    ::setrlimit(RLIMIT_NOFILE, &tight);
+    for (;;) {
+      UniqueFd filler(::dup(0));
+      if (!filler.isValid()) break;
+      fillers_.push_back(std::move(filler));
+    }
+    giveBack(count);
   }
-  pump();  // takes the waiting connection off the queue, unserved
-  EXPECT_TRUE(isClosed(waiting));
-  EXPECT_EQ(log.entries(), std::vector{RecordingLog::unifiedLine(
-                               LogLevel::error, "out of descriptors: a connection was closed unserved")});
-  EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::timedOut);
-  fillers.clear();
-  ::setrlimit(RLIMIT_NOFILE, &old);
+  ~DescriptorShortage() { ::setrlimit(RLIMIT_NOFILE, &before_); }
+  DescriptorShortage(const DescriptorShortage&) = delete;
+  DescriptorShortage& operator=(const DescriptorShortage&) = delete;
+  void giveBack(std::size_t count) { fillers_.resize(fillers_.size() - count); }
+
+ private:
+  rlimit before_{};
+  std::vector<UniqueFd> fillers_;
+};
+
+TEST_F(ServiceTest, WithoutDescriptorsACheckInIsAnsweredWith6AndALineAndNobodySpins) {
+  listen();
+  auto [kept, sent] = pair();
+  Datagram checkIn = complexMessage(kKeepRight, 1, 40).add(right());
+  checkIn.fds = {sent.get()};
+  const UniqueFd early = connect();
+  const UniqueFd another = connect();
+  ASSERT_TRUE(sendTo(early.get(), checkIn));
+  ASSERT_TRUE(sendTo(another.get(), checkIn));
+  const std::size_t before = openDescriptors();
+  {
+    const DescriptorShortage shortage(0);
+    for (const auto* const connection : {&early, &another}) {
+      std::optional<Answer> answer;
+      while (!(answer = receiveFrom(connection->get()))) {
+        ASSERT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);
+      }
+      EXPECT_EQ(answer->code(), kern::resourceShortage);
+      while (!isClosed(*connection)) {
+        ASSERT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);
+      }
+    }
+    EXPECT_EQ(table.served, 0);
+    EXPECT_EQ(
+        log.entries().front(),
+        RecordingLog::unifiedLine(LogLevel::error, "out of descriptors or memory: a check-in was refused"));
+    EXPECT_EQ(log.entries().size(), 2U);
+    ports.closing().drain();
+    loop->run(1s, ReturnAfterSource::yes);
+    EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::timedOut);
+  }
+  ports.closing().drain();
+  EXPECT_LE(openDescriptors(), before + 3) << "what the first discarded message needs stays: " << before;
   const UniqueFd later = connect();
-  ASSERT_TRUE(sendTo(later.get(), message(kEcho)));
+  ASSERT_TRUE(sendTo(later.get(), checkIn));
   pump();
-  EXPECT_TRUE(receiveFrom(later.get()));
+  const auto answer = receiveFrom(later.get());
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->code(), 0);
+}
+
+TEST_F(ServiceTest, WhoeverIsServedFindsDescriptorsForALook) {
+  listen();
+  const UniqueFd connection = connect();
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  int opened = 0;
+  table.whileServing = [&] {
+    std::vector<UniqueFd> files;
+    while (true) {
+      files.emplace_back(::open("/", O_PATH | O_CLOEXEC));
+      if (!files.back().isValid()) break;
+      ++opened;
+    }
+  };
+  const DescriptorShortage shortage(1);  // for the connection
+  pump();
+  EXPECT_EQ(table.served, 1);
+  EXPECT_GE(opened, 8);
+}
+
+TEST_F(ServiceTest, ConnectionsOfManyAccountsGiveWayWhenDescriptorsRunOut) {
+  listen();
+  const UniqueFd silent = connect();
+  pump();
+  const UniqueFd connection = connect();
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  const DescriptorShortage shortage(0);
+  pump();
+  EXPECT_TRUE(isClosed(silent));
+  const auto answer = receiveFrom(connection.get());
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->code(), 0);
+}
+
+TEST_F(ServiceTest, AnUnknownMessageIsRefusedByItsFormWhateverComesAlong) {
+  listen();
+  const UniqueFd connection = connect();
+  const UniqueFd null(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+  Datagram unknown = complexMessage(99, 1, 40).add(right());
+  unknown.fds = {null.get()};
+  const std::size_t before = openDescriptors();
+  for (int i = 0; i < 3; ++i) {
+    ASSERT_TRUE(sendTo(connection.get(), unknown));
+    pump();
+    const auto answer = receiveFrom(connection.get());
+    ASSERT_TRUE(answer);
+    EXPECT_EQ(answer->code(), -303);
+  }
+  ports.closing().drain();
+  EXPECT_EQ(openDescriptors(), before + 1) << "the connection";
+}
+
+TEST_F(ServiceTest, NothingOfAStrangersIsMapped) {
+  listen();
+  const UniqueFd connection = connect();
+  const UniqueFd sealed = memfd("abc");
+  Datagram request = complexMessage(kEcho, 1, 44).add(region(0, 3));
+  request.fds = {sealed.get()};
+  ASSERT_TRUE(sendTo(connection.get(), request));
+  pump();
+  const auto answer = receiveFrom(connection.get());
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->code(), -304);
+  EXPECT_EQ(table.served, 0);
+}
+
+TEST_F(ServiceTest, AMessageWithMoreThanOneDescriptorIsAnsweredAndDroppedElsewhereAndTheConnectionGoesOn) {
+  listen();
+  const UniqueFd connection = connect();
+  auto [kept, sent] = pair();
+  for (const std::size_t count : {std::size_t{2}, std::size_t{253}}) {
+    Datagram request = complexMessage(kKeepRight, 1, 40).add(right());
+    request.fds.assign(count, sent.get());
+    ASSERT_TRUE(sendTo(connection.get(), request));
+    ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+    pump();
+    auto answer = receiveFrom(connection.get());
+    ASSERT_TRUE(answer);
+    EXPECT_EQ(answer->code(), -304);
+    while (!(answer = receiveFrom(connection.get()))) {
+      ASSERT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);
+    }
+    EXPECT_EQ(answer->code(), 0);
+  }
+  sent.reset();
+  ports.closing().drain();
+  pollfd hungUp{kept.get(), POLLIN, 0};
+  EXPECT_EQ(::poll(&hungUp, 1, 0), 1) << "none is kept";
+}
+
+TEST_F(ServiceTest, AnAccountThatIsRefusedTooOftenWaitsAndIsThenAnswered) {
+  listen();
+  table.refuseWith = kern::invalidSecurity;
+  const UniqueFd connection = connect();
+  int answers = 0;
+  const auto refused = [&] {
+    EXPECT_TRUE(sendTo(connection.get(), message(kRefuse)));
+    pump();
+    const auto answer = receiveFrom(connection.get());
+    return answer && answer->code() == kern::invalidSecurity;
+  };
+  while (refused()) ASSERT_LT(++answers, 1000);
+  EXPECT_GE(answers, 50);
+  const UniqueFd another = connect();
+  ASSERT_TRUE(sendTo(another.get(), message(kEcho)));
+  ASSERT_EQ(codeOf(message(kEcho)), 0) << "who is checked in does not wait";
+  std::optional<Answer> answer;
+  while (!(answer = receiveFrom(another.get()))) {
+    ASSERT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);
+  }
+  EXPECT_EQ(answer->code(), 0) << "who may come in comes in";
+}
+
+TEST_F(ServiceTest, AClientTakesTwoDescriptors) {
+  listen();
+  const std::size_t before = openDescriptors();
+  struct Client {
+    UniqueFd life;
+    UniqueFd channel;
+  };
+  std::vector<Client> clients;
+  for (int i = 0; i < 100; ++i) {
+    PortName given = kNullPort;
+    ASSERT_EQ(ports.allocateReceiveRight(&given), kern::success);
+    ASSERT_EQ(ports.insertSendRight(given), kern::success);
+    table.given = given;
+    auto [life, sent] = pair();
+    Datagram checkIn = complexMessage(kGiveRight, 1, 40).add(right());
+    checkIn.fds = {sent.get()};
+    const UniqueFd connection = connect();
+    ASSERT_TRUE(sendTo(connection.get(), checkIn));
+    sent.reset();
+    pump();
+    auto answer = receiveFrom(connection.get());
+    ASSERT_TRUE(answer && answer->fds.size() == 1);
+    clients.push_back({std::move(life), std::move(answer->fds[0])});
+  }
+  pump();
+  EXPECT_EQ(openDescriptors(), before + clients.size() * (2 + 2)) << "two of theirs, two of ours";
+}
+
+TEST_F(ServiceTest, ConnectionsOfClientsAreKeptUpToALimitAndTheClientsStay) {
+  listen();
+  std::vector<UniqueFd> connections;
+  for (int i = 0; i < 40; ++i) {
+    connections.push_back(connect());
+    ASSERT_TRUE(sendTo(connections.back().get(), message(kEcho)));
+    pump();
+    ASSERT_TRUE(receiveFrom(connections.back().get()));
+  }
+  EXPECT_EQ(std::count_if(connections.begin(), connections.end(), isClosed), 40 - 32);
+  EXPECT_TRUE(isClosed(connections.front()));
 }
 
 TEST_F(ServiceTest, InvalidatingTheServiceGivesEveryConnectionEndOfFile) {

@@ -1,0 +1,148 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/ipc/linux/ClosingLine.h"
+
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <array>
+#include <chrono>
+#include <cstring>
+#include <thread>
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+using Clock = std::chrono::steady_clock;
+
+std::pair<UniqueFd, UniqueFd> pair() {
+  std::array<int, 2> ends{};
+  EXPECT_EQ(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()), 0);
+  return {UniqueFd(ends[0]), UniqueFd(ends[1])};
+}
+
+bool hasHungUp(const UniqueFd& fd) {
+  pollfd state{fd.get(), 0, 0};
+  return ::poll(&state, 1, 0) == 1;
+}
+
+bool send(const UniqueFd& socket, int descriptor) {
+  char byte = 'x';
+  iovec io{&byte, 1};
+  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
+  msghdr message{};
+  message.msg_iov = &io;
+  message.msg_iovlen = 1;
+  message.msg_control = control.data();
+  message.msg_controllen = control.size();
+  cmsghdr* const item = CMSG_FIRSTHDR(&message);
+  item->cmsg_level = SOL_SOCKET;
+  item->cmsg_type = SCM_RIGHTS;
+  item->cmsg_len = CMSG_LEN(sizeof(int));
+  std::memcpy(CMSG_DATA(item), &descriptor, sizeof descriptor);
+  return ::sendmsg(socket.get(), &message, 0) == 1;
+}
+
+// A TCP socket whose last close waits an hour: what it has sent is never read.
+struct Lingering {
+  UniqueFd listening{::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+  UniqueFd socket{::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0)};
+
+  Lingering() {
+    const int small = 1;
+    ::setsockopt(listening.get(), SOL_SOCKET, SO_RCVBUF, &small, sizeof small);
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    socklen_t size = sizeof address;
+    auto* const raw = reinterpret_cast<sockaddr*>(&address);
+    EXPECT_EQ(::bind(listening.get(), raw, size), 0);
+    EXPECT_EQ(::listen(listening.get(), 1), 0);
+    EXPECT_EQ(::getsockname(listening.get(), raw, &size), 0);
+    (void)::connect(socket.get(), raw, size);
+    pollfd connected{socket.get(), POLLOUT, 0};
+    EXPECT_EQ(::poll(&connected, 1, 10'000), 1);
+    const linger hour{1, 3600};
+    EXPECT_EQ(::setsockopt(socket.get(), SOL_SOCKET, SO_LINGER, &hour, sizeof hour), 0);
+    const std::vector<char> block(65536);
+    while (::send(socket.get(), block.data(), block.size(), MSG_DONTWAIT | MSG_NOSIGNAL) > 0) {
+    }
+  }
+};
+
+TEST(ClosingLineTest, ClosesWhatItIsGiven) {
+  ClosingLine line;
+  auto [kept, given] = pair();
+  line.close(std::move(given), 1);
+  line.drain();
+  EXPECT_TRUE(hasHungUp(kept));
+}
+
+TEST(ClosingLineTest, TheEndWaitsForWhatIsLeft) {
+  auto [kept, given] = pair();
+  {
+    ClosingLine line;
+    line.close(std::move(given), 1);
+  }
+  EXPECT_TRUE(hasHungUp(kept));
+}
+
+TEST(ClosingLineTest, OneMessageIsDroppedWithItsDescriptorsAndTheTokenIsTold) {
+  ClosingLine line;
+  auto [sender, receiver] = pair();
+  auto [kept, given] = pair();
+  ASSERT_TRUE(send(sender, given.get()));
+  ASSERT_EQ(::send(sender.get(), "next", 4, 0), 4);
+  given.reset();
+  EXPECT_EQ(line.readable(), -1);
+  const auto shared = std::make_shared<const UniqueFd>(std::move(receiver));
+  ASSERT_TRUE(line.discardMessage(shared, 1, 42));
+  line.drain();
+  EXPECT_TRUE(hasHungUp(kept));
+  pollfd told{line.readable(), POLLIN, 0};
+  EXPECT_EQ(::poll(&told, 1, 0), 1);
+  EXPECT_EQ(line.takeDiscarded(), std::vector<std::uint64_t>{42});
+  EXPECT_EQ(::poll(&told, 1, 0), 0);
+  std::array<char, 8> next{};
+  EXPECT_EQ(::recv(shared->get(), next.data(), next.size(), MSG_DONTWAIT), 4);
+}
+
+TEST(ClosingLineTest, ASocketThatLingersForAnHourHoldsUpNobody) {
+  ClosingLine line;
+  const auto started = Clock::now();
+  auto [kept, given] = pair();
+  Lingering direct;
+  Lingering inside;
+  auto [sender, receiver] = pair();
+  ASSERT_TRUE(send(sender, inside.socket.get()));
+  inside.socket.reset();
+  line.close(std::move(direct.socket), 1);
+  line.close(std::move(receiver), 1);  // with the other one in its queue
+  line.close(std::move(given), 2);
+  while (!hasHungUp(kept)) std::this_thread::yield();
+  EXPECT_LT(Clock::now() - started, 10s) << "another account's job waits for neither";
+  line.drain();
+  EXPECT_LT(Clock::now() - started, 60s) << "both are interrupted";
+}
+
+TEST(ClosingLineTest, AFullLineTakesNoMoreAndClosesOnTheCallersThread) {
+  ClosingLine line;
+  EXPECT_TRUE(line.hasRoomFor(ClosingLine::kCapacity));
+  EXPECT_FALSE(line.hasRoomFor(ClosingLine::kCapacity + 1));
+  std::vector<std::pair<UniqueFd, UniqueFd>> many;
+  for (std::size_t i = 0; i < 2 * ClosingLine::kCapacity; ++i) {
+    auto [kept, given] = pair();
+    line.close(std::move(given), 1);
+    if (i % 16 == 0) many.emplace_back(std::move(kept), UniqueFd());
+  }
+  line.drain();
+  for (const auto& [kept, none] : many) EXPECT_TRUE(hasHungUp(kept));
+}
+
+}  // namespace
+}  // namespace brenvik
