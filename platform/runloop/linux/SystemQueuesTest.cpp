@@ -543,16 +543,6 @@ class NoDescriptors {
   std::vector<UniqueFd> taken_;
 };
 
-// Runs a task on the queue and one that is delayed; whether both ran on a thread that is not this one.
-bool works(WorkQueue& queue) {
-  std::promise<bool> done;
-  queue.post([&] {
-    queue.postAfter(1ms, [&, on = std::this_thread::get_id()] {
-      done.set_value(on == std::this_thread::get_id() && queue.isCurrent());
-    });
-  });
-  return done.get_future().get() && !queue.isCurrent();
-}
 
 constexpr std::size_t kReservedQueues = SystemQueues::kReservedDescriptors / EventLoop::kDescriptors;
 
