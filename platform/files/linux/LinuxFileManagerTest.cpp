@@ -447,6 +447,80 @@ TEST_F(LinuxFileManagerTest, ADirectoryCannotComeToStandInsideItself) {
   EXPECT_EQ(copy("tree", "tree-copy"), kSuccess);
 }
 
+// ---- links on the way
+
+class WayTest : public LinuxFileManagerTest {
+ protected:
+  WayTest() {
+    dir.file("outside/file", "kept");
+    dir.file("source", "x");
+    dir.directory("folder");
+  }
+  // Every operation by way of folder/link.
+  std::vector<FileOutcome> outcomes() {
+    const std::string way = dir / "folder/link";
+    const auto written = files.writeFileAtomically(way + "/written", "x") ? kSuccess : failure(ENOENT);
+    return {copy("source", "folder/link/copy"),
+            files.createDirectory(way + "/fresh/below", {}, Intermediates::create),
+            files.placeLink(way + "/link", "target"),
+            files.setAttributes(way + "/file", {0604, {}, {}}),
+            written,
+            move("folder/link/file", "moved"),
+            move("moved", "folder/link/file"),
+            files.removeEntry(way + "/written"),
+            files.removeItem(way + "/copy"),
+            files.removeItem(way + "/fresh"),
+            files.removeItem(way + "/link")};
+  }
+  void expectRefused() {
+    const struct stat before = statOf(dir / "outside/file");
+    dir.file("outside/written", "theirs");
+    dir.file("outside/copy", "theirs");
+    dir.file("outside/link", "theirs");
+    dir.file("moved", "x");
+    for (const FileOutcome& outcome : outcomes()) EXPECT_EQ(outcome, failure(ENOENT));
+    EXPECT_EQ(names("outside"), (std::vector<std::string>{"copy", "file", "link", "written"}));
+    for (const char* name : {"written", "copy", "link"}) {
+      EXPECT_EQ(contentOf(dir / ("outside/" + std::string(name))), "theirs");
+    }
+    EXPECT_EQ(statOf(dir / "outside/file").st_mode, before.st_mode);
+    EXPECT_TRUE(isThere(dir / "moved"));
+  }
+};
+
+TEST_F(WayTest, ALinkThatOnlyThisAccountCanHaveMadeIsFollowed) {
+  for (const std::string& target :
+       {dir / "outside", std::string("../outside"), std::string("../folder/../outside/")}) {
+    std::filesystem::remove(dir / "folder/link");
+    dir.link("folder/link", target);
+    for (const FileOutcome& outcome : outcomes()) EXPECT_EQ(outcome, kSuccess) << target;
+    EXPECT_EQ(contentOf(dir / "outside/file"), "kept");
+    EXPECT_EQ(statOf(dir / "outside/file").st_mode & 0777, 0604u);
+    EXPECT_EQ(names("outside"), (std::vector<std::string>{"file"}));
+  }
+  std::filesystem::remove(dir / "folder/link");
+  dir.link("folder/link", "link");
+  EXPECT_EQ(copy("source", "folder/link/copy"), failure(ELOOP));
+}
+
+TEST_F(WayTest, ALinkOfAnotherAccountIsNoWay) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give links away";
+  ASSERT_EQ(::lchown(dir.link("folder/link", dir / "outside").c_str(), 4711, 4711), 0);
+  expectRefused();
+}
+
+TEST_F(WayTest, ALinkInAFolderThatAnotherAccountMayWriteIsNoWay) {
+  dir.link("folder/link", dir / "outside");
+  for (const mode_t mode : {0775u, 0757u, 01777u}) {
+    ASSERT_EQ(::chmod((dir / "folder").c_str(), mode), 0);
+    expectRefused();
+  }
+  ASSERT_EQ(::chmod((dir / "folder").c_str(), 0755), 0);
+  if (::geteuid() != 0) return;
+  ASSERT_EQ(::chown((dir / "folder").c_str(), 4711, 4711), 0);
+  expectRefused();
+}
+
 // ---- leftovers
 
 class LeftoversTest : public LinuxFileManagerTest {
