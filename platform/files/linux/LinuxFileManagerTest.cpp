@@ -807,6 +807,37 @@ TEST_F(MoveAcrossTest, AwayFromAFullDiskItWorksAllTheSame) {
   });
 }
 
+TEST_F(MoveAcrossTest, KilledAtAnyMomentItIsWholeAtOneOfTheTwoPlaces) {
+  const std::string content(20'000, 'c');
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 4096);
+    const auto isWhole = [&](const std::string& tree) {
+      return contentOf(dir / (tree + "/other")) == content &&
+             contentOf(dir / (tree + "/sub/file")) == content;
+    };
+    for (int round = 0; round < 60; ++round) {
+      std::filesystem::remove_all(dir / "disk/moved");
+      dir.file("from/tree/sub/file", content);
+      dir.file("from/tree/other", content);
+      const pid_t child = ::fork();
+      if (child == 0) {
+        killThisProcessAfter(std::chrono::microseconds(100 + round * 61));
+        (void)move("from/tree", "disk/moved");
+        ::_exit(0);
+      }
+      ::waitpid(child, nullptr, 0);
+      ASSERT_TRUE(isWhole("from/tree") || isWhole("disk/moved")) << round;
+      ASSERT_TRUE(isWhole("from/tree") || !isThere(dir / "from/tree")) << round;
+      ASSERT_TRUE(isWhole("disk/moved") || !isThere(dir / "disk/moved")) << round;
+    }
+    EXPECT_EQ(files.placeLink(dir / "from/link", "target"), kSuccess);
+    EXPECT_EQ(files.placeLink(dir / "disk/link", "target"), kSuccess);
+    for (const char* const folder : {"from", "disk"}) {
+      for (const std::string& name : names(folder)) EXPECT_FALSE(name.starts_with(".brenvik")) << name;
+    }
+  });
+}
+
 TEST_F(MoveAcrossTest, IntoItselfByWayOfAnotherMountItStaysWhole) {
   inPrivateMounts([&] {
     const std::string sub = dir / "from/tree/sub";
