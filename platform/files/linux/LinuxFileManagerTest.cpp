@@ -634,6 +634,8 @@ TEST_F(LeftoversTest, WhatAStrangerMadeUnderSuchANameIsNeverRemoved) {
   EXPECT_EQ(files.placeLink(dir / "to/copied", "target"), kSuccess);
   for (const std::string& path : planted) EXPECT_TRUE(isThere(dir / path)) << path;
   EXPECT_EQ(names("to").size(), planted.size() + 3);
+  EXPECT_EQ(contentOf(dir / "to/.brenvik-0123456789abcdef/new"), "open to others");
+  EXPECT_EQ(contentOf(dir / "to/.brenvik-0123456789abcde0/new"), "and");
   EXPECT_EQ(contentOf(dir / ("to/" + left + "/theirs")), "kept");
 }
 
