@@ -136,7 +136,7 @@ KernelReturn CarrierOperations::copyCarrierFile(PortName, char* sourceDirectory,
       if (!fileSystem->isDirectory(source) && before.standsAt(copied)) return kern::success;
       const MobileAccount account = account_();
       // A link was copied as a link, and is given away as one: what it points to is not ours to give.
-      *success = ::lchown(destination.c_str(), account.uid, account.gid) == 0 &&
+      *success = fileSystem->giveItem(destination, account.uid, account.gid) == 0 &&
                  fileSystem->syncItem(destination) == 0;
     } else {
       logBsd(SyslogPriority::error, "Failed to copy the file %s to %s\n", sourceDirectory,

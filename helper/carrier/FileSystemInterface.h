@@ -76,12 +76,15 @@ class FileSystemInterface {
   // Truncates what is there.
   virtual bool createEmptyFile(const std::string& path) noexcept = 0;
 
-  // What the requests need beyond the slots above. Each is on the disk when it succeeds.
-  // A link where nothing, a file, a link or an empty directory stands; what was there stays when it fails.
+  // What the requests need beyond the slots above. Each is on the disk when it succeeds, unless it says
+  // otherwise. A link where nothing, a file, a link or an empty directory stands; what was there stays when
+  // it fails.
   virtual int placeLink(const std::string& linkPath, const std::string& target) noexcept = 0;
   // A file, a link or an empty directory.
   virtual int removeEntry(const std::string& path) noexcept = 0;
   virtual int syncItem(const std::string& path) noexcept = 0;
+  // Changes the owner of the item itself: of a link, not of what it points to. Not yet on the disk.
+  virtual int giveItem(const std::string& path, uid_t uid, gid_t gid) noexcept = 0;
 };
 
 // Makes the object of one request; null when memory is exhausted. Called and used on the main thread.

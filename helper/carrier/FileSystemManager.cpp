@@ -383,4 +383,8 @@ int FileSystemManager::syncItem(const std::string& path) noexcept {
   return files().syncItem(path).codeOr(kUnexplained);
 }
 
+int FileSystemManager::giveItem(const std::string& path, uid_t uid, gid_t gid) noexcept {
+  return files().setAttributes(path, {{}, uid, gid}).codeOr(kUnexplained);
+}
+
 }  // namespace brenvik

@@ -53,6 +53,7 @@ class FileSystemManager final : public FileSystemInterface {
   int placeLink(const std::string& linkPath, const std::string& target) noexcept override;
   int removeEntry(const std::string& path) noexcept override;
   int syncItem(const std::string& path) noexcept override;
+  int giveItem(const std::string& path, uid_t uid, gid_t gid) noexcept override;
 
  private:
   enum class Mode { copy, move };

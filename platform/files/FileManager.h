@@ -64,8 +64,10 @@ class ItemVisitor {
 };
 
 // The platform's file manager: whole items, with data, modes, owners (as far as permitted), times, links and
-// extended attributes. Paths are NUL-terminated bytes. Links on the way to an item are followed; a link that
-// is itself the item is copied, moved or removed as a link, and nothing is ever written through one.
+// extended attributes. Paths are NUL-terminated bytes. A link that is itself the item is copied, moved or
+// removed as a link, and nothing is ever written through one. On the way to what is made, changed or removed,
+// a link is followed only when nobody but root and this account can have put it there; else the operation
+// fails as if the directory were missing. On the way to what is read, links are followed.
 //
 // A copy or a move shows at its destination whole or not at all, even when the process is killed. What a
 // killed process leaves is a hidden ".brenvik-" item beside the destination; the next operation in that

@@ -304,16 +304,25 @@ FileOutcome LinuxFileManager::moveItem(const std::string& source, const std::str
 }
 
 FileOutcome LinuxFileManager::removeItem(const std::string& path) noexcept {
-  return guarded([&] { return removeTree(AT_FDCWD, path.c_str()); });
+  return guarded([&] {
+    Place place;
+    const int error = Place::open(path, &place);
+    return error != 0 ? error : removeTree(place.directory.get(), place.name.c_str());
+  });
 }
 
 FileOutcome LinuxFileManager::removeEntry(const std::string& path) noexcept {
   return guarded([&] {
-    if (std::remove(path.c_str()) != 0) return errno;
     Place place;
-    // EEXIST: a directory removed as "name/." is none that remove(3) accepts.
     if (const int error = openPlace(path, &place); error != 0) return error;
-    return syncNames(place.directory.get());
+    const int directory = place.directory.get();
+    const char* const name = place.name.c_str();
+    struct stat info {};
+    if (::fstatat(directory, name, &info, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+    const bool isDirectoryThere = S_ISDIR(info.st_mode);
+    if (path.ends_with('/') && !isDirectoryThere) return ENOTDIR;
+    if (::unlinkat(directory, name, isDirectoryThere ? AT_REMOVEDIR : 0) != 0) return errno;
+    return syncNames(directory);
   });
 }
 
@@ -425,18 +434,30 @@ FileOutcome LinuxFileManager::enumerateBelow(const std::string& path, ItemVisito
 FileOutcome LinuxFileManager::setAttributes(const std::string& path,
                                             const ItemAttributes& attributes) noexcept {
   return guarded([&] {
+    // Of the item itself, and both of the same one: whoever owns the directory may put another in its place.
+    Place place;
+    UniqueFd item;
+    const int error = Place::open(path, &place);
+    if (error == 0) {
+      item.reset(::openat(place.directory.get(), place.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+      if (!item.isValid()) return errno;
+    } else if (error != EEXIST) {
+      return error;
+    } else if (const int failed = openDirectory(path, &item); failed != 0) {
+      return failed;
+    }
     if (attributes.uid || attributes.gid) {
       const uid_t uid = attributes.uid.value_or(static_cast<uid_t>(-1));
       const gid_t gid = attributes.gid.value_or(static_cast<gid_t>(-1));
-      if (::fchownat(AT_FDCWD, path.c_str(), uid, gid, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+      if (::fchownat(item.get(), "", uid, gid, AT_EMPTY_PATH) != 0) return errno;
     }
-    if (attributes.mode) {
-      // Of the item itself: whoever owns the directory may put a link in its place at any moment.
-      const mode_t mode = *attributes.mode & 07777;
-      if (::fchmodat(AT_FDCWD, path.c_str(), mode, AT_SYMLINK_NOFOLLOW) != 0 && errno != EOPNOTSUPP)
-        return errno;
-    }
-    return 0;
+    struct stat info {};
+    if (!attributes.mode) return 0;
+    if (::fstat(item.get(), &info) != 0) return errno;
+    if (S_ISLNK(info.st_mode)) return 0;
+    char self[32];
+    (void)std::snprintf(self, sizeof self, "/proc/self/fd/%d", item.get());
+    return ::chmod(self, *attributes.mode & 07777) == 0 ? 0 : errno;
   });
 }
 

@@ -447,6 +447,80 @@ TEST_F(LinuxFileManagerTest, ADirectoryCannotComeToStandInsideItself) {
   EXPECT_EQ(copy("tree", "tree-copy"), kSuccess);
 }
 
+// ---- links on the way
+
+class WayTest : public LinuxFileManagerTest {
+ protected:
+  WayTest() {
+    dir.file("outside/file", "kept");
+    dir.file("source", "x");
+    dir.directory("folder");
+  }
+  // Every operation by way of folder/link.
+  std::vector<FileOutcome> outcomes() {
+    const std::string way = dir / "folder/link";
+    const auto written = files.writeFileAtomically(way + "/written", "x") ? kSuccess : failure(ENOENT);
+    return {copy("source", "folder/link/copy"),
+            files.createDirectory(way + "/fresh/below", {}, Intermediates::create),
+            files.placeLink(way + "/link", "target"),
+            files.setAttributes(way + "/file", {0604, {}, {}}),
+            written,
+            move("folder/link/file", "moved"),
+            move("moved", "folder/link/file"),
+            files.removeEntry(way + "/written"),
+            files.removeItem(way + "/copy"),
+            files.removeItem(way + "/fresh"),
+            files.removeItem(way + "/link")};
+  }
+  void expectRefused() {
+    const struct stat before = statOf(dir / "outside/file");
+    dir.file("outside/written", "theirs");
+    dir.file("outside/copy", "theirs");
+    dir.file("outside/link", "theirs");
+    dir.file("moved", "x");
+    for (const FileOutcome& outcome : outcomes()) EXPECT_EQ(outcome, failure(ENOENT));
+    EXPECT_EQ(names("outside"), (std::vector<std::string>{"copy", "file", "link", "written"}));
+    for (const char* name : {"written", "copy", "link"}) {
+      EXPECT_EQ(contentOf(dir / ("outside/" + std::string(name))), "theirs");
+    }
+    EXPECT_EQ(statOf(dir / "outside/file").st_mode, before.st_mode);
+    EXPECT_TRUE(isThere(dir / "moved"));
+  }
+};
+
+TEST_F(WayTest, ALinkThatOnlyThisAccountCanHaveMadeIsFollowed) {
+  for (const std::string& target :
+       {dir / "outside", std::string("../outside"), std::string("../folder/../outside/")}) {
+    std::filesystem::remove(dir / "folder/link");
+    dir.link("folder/link", target);
+    for (const FileOutcome& outcome : outcomes()) EXPECT_EQ(outcome, kSuccess) << target;
+    EXPECT_EQ(contentOf(dir / "outside/file"), "kept");
+    EXPECT_EQ(statOf(dir / "outside/file").st_mode & 0777, 0604u);
+    EXPECT_EQ(names("outside"), (std::vector<std::string>{"file"}));
+  }
+  std::filesystem::remove(dir / "folder/link");
+  dir.link("folder/link", "link");
+  EXPECT_EQ(copy("source", "folder/link/copy"), failure(ELOOP));
+}
+
+TEST_F(WayTest, ALinkOfAnotherAccountIsNoWay) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give links away";
+  ASSERT_EQ(::lchown(dir.link("folder/link", dir / "outside").c_str(), 4711, 4711), 0);
+  expectRefused();
+}
+
+TEST_F(WayTest, ALinkInAFolderThatAnotherAccountMayWriteIsNoWay) {
+  dir.link("folder/link", dir / "outside");
+  for (const mode_t mode : {0775u, 0757u, 01777u}) {
+    ASSERT_EQ(::chmod((dir / "folder").c_str(), mode), 0);
+    expectRefused();
+  }
+  ASSERT_EQ(::chmod((dir / "folder").c_str(), 0755), 0);
+  if (::geteuid() != 0) return;
+  ASSERT_EQ(::chown((dir / "folder").c_str(), 4711, 4711), 0);
+  expectRefused();
+}
+
 // ---- leftovers
 
 class LeftoversTest : public LinuxFileManagerTest {
@@ -560,6 +634,8 @@ TEST_F(LeftoversTest, WhatAStrangerMadeUnderSuchANameIsNeverRemoved) {
   EXPECT_EQ(files.placeLink(dir / "to/copied", "target"), kSuccess);
   for (const std::string& path : planted) EXPECT_TRUE(isThere(dir / path)) << path;
   EXPECT_EQ(names("to").size(), planted.size() + 3);
+  EXPECT_EQ(contentOf(dir / "to/.brenvik-0123456789abcdef/new"), "open to others");
+  EXPECT_EQ(contentOf(dir / "to/.brenvik-0123456789abcde0/new"), "and");
   EXPECT_EQ(contentOf(dir / ("to/" + left + "/theirs")), "kept");
 }
 
@@ -730,6 +806,37 @@ TEST_F(MoveAcrossTest, AwayFromAFullDiskItWorksAllTheSame) {
     EXPECT_EQ(move("disk/tree", "moved"), kSuccess);
     EXPECT_EQ(contentOf(dir / "moved/file"), "x");
     EXPECT_EQ(names("disk"), (std::vector<std::string>{"last"}));
+  });
+}
+
+TEST_F(MoveAcrossTest, KilledAtAnyMomentItIsWholeAtOneOfTheTwoPlaces) {
+  const std::string content(20'000, 'c');
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 4096);
+    const auto isWhole = [&](const std::string& tree) {
+      return contentOf(dir / (tree + "/other")) == content &&
+             contentOf(dir / (tree + "/sub/file")) == content;
+    };
+    for (int round = 0; round < 60; ++round) {
+      std::filesystem::remove_all(dir / "disk/moved");
+      dir.file("from/tree/sub/file", content);
+      dir.file("from/tree/other", content);
+      const pid_t child = ::fork();
+      if (child == 0) {
+        killThisProcessAfter(std::chrono::microseconds(100 + round * 61));
+        (void)move("from/tree", "disk/moved");
+        ::_exit(0);
+      }
+      ::waitpid(child, nullptr, 0);
+      ASSERT_TRUE(isWhole("from/tree") || isWhole("disk/moved")) << round;
+      ASSERT_TRUE(isWhole("from/tree") || !isThere(dir / "from/tree")) << round;
+      ASSERT_TRUE(isWhole("disk/moved") || !isThere(dir / "disk/moved")) << round;
+    }
+    EXPECT_EQ(files.placeLink(dir / "from/link", "target"), kSuccess);
+    EXPECT_EQ(files.placeLink(dir / "disk/link", "target"), kSuccess);
+    for (const char* const folder : {"from", "disk"}) {
+      for (const std::string& name : names(folder)) EXPECT_FALSE(name.starts_with(".brenvik")) << name;
+    }
   });
 }
 

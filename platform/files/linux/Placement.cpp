@@ -5,9 +5,11 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <limits.h>
+#include <linux/openat2.h>
 #include <sys/file.h>
 #include <sys/random.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -41,6 +43,7 @@ namespace {
 constexpr std::string_view kPrefix = ".brenvik-";
 constexpr std::size_t kRoomDigits = 16;
 constexpr int kAttempts = 8;
+constexpr int kMostLinks = 40;  // as the kernel follows on one way
 
 using HiddenName = char[48];
 
@@ -81,6 +84,13 @@ bool isEntry(int directory, const char* name, int item) {
 }
 
 bool isOwn(const struct stat& info) { return info.st_uid == ::geteuid(); }
+
+// Whether nobody but root and this account can have made the link, or can replace it.
+bool isTrusted(int directory, const struct stat& link) {
+  struct stat info {};
+  if (::fstat(directory, &info) != 0 || (info.st_mode & 0022) != 0) return false;
+  return (link.st_uid == 0 || isOwn(link)) && (info.st_uid == 0 || isOwn(info));
+}
 
 bool lock(int item) { return ::flock(item, LOCK_EX | LOCK_NB) == 0; }
 
@@ -158,6 +168,46 @@ int renameOver(int directory, const char* from, const char* to) {
 
 }  // namespace
 
+int openDirectory(const std::string& path, UniqueFd* directory) {
+  if (path.empty()) return ENOENT;
+  open_how how{};
+  how.flags = O_PATH | O_DIRECTORY | O_CLOEXEC;
+  how.resolve = RESOLVE_NO_SYMLINKS;
+  directory->reset(static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how)));
+  // ELOOP: there is a link on the way. ENOSYS: a service manager's filter, which cannot look into the
+  // arguments.
+  if (directory->isValid() || (errno != ELOOP && errno != ENOSYS)) return directory->isValid() ? 0 : errno;
+
+  std::string rest = path;
+  int links = 0;
+  UniqueFd at(::open(rest.front() == '/' ? "/" : ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  while (at.isValid()) {
+    rest.erase(0, rest.find_first_not_of('/'));
+    if (rest.empty()) {
+      *directory = std::move(at);
+      return 0;
+    }
+    const std::string name = rest.substr(0, rest.find('/'));
+    rest.erase(0, name.size());
+    UniqueFd next(::openat(at.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    struct stat info {};
+    if (!next.isValid() || ::fstat(next.get(), &info) != 0) return errno;
+    if (!S_ISLNK(info.st_mode)) {
+      if (!S_ISDIR(info.st_mode)) return ENOTDIR;
+      at = std::move(next);
+      continue;
+    }
+    if (++links > kMostLinks) return ELOOP;
+    if (!isTrusted(at.get(), info)) return ENOENT;
+    char target[PATH_MAX];
+    const ssize_t length = ::readlinkat(next.get(), "", target, sizeof target);
+    if (length <= 0) return length < 0 ? errno : ENOENT;
+    rest.insert(0, std::string(target, static_cast<std::size_t>(length)) + "/");
+    if (target[0] == '/') at.reset(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  }
+  return errno;
+}
+
 int Place::open(const std::string& path, Place* place) {
   std::size_t end = path.size();
   while (end > 0 && path[end - 1] == '/') --end;
@@ -166,8 +216,7 @@ int Place::open(const std::string& path, Place* place) {
   place->name = slash == std::string::npos ? path.substr(0, end) : path.substr(slash + 1, end - slash - 1);
   if (place->name == "." || place->name == "..") return EEXIST;
   const std::string parent = slash == std::string::npos ? "." : path.substr(0, slash + 1);
-  place->directory.reset(::open(parent.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-  return place->directory.isValid() ? 0 : errno;
+  return openDirectory(parent, &place->directory);
 }
 
 void removeLeftovers(int directory) {

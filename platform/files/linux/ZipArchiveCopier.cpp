@@ -104,13 +104,13 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
   // way. Directories missing above it are made with it, so that an archive that fails leaves none behind.
   MissingPath missing;
   Place& place = missing.place;
-  UniqueFd existing(::open(destination.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (existing.isValid()) {
-    place.directory.reset(::openat(existing.get(), ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
-    if (!place.directory.isValid()) return errno;
+  UniqueFd existing;
+  if (const int error = openDirectory(destination, &place.directory); error == 0) {
+    existing.reset(::openat(place.directory.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!existing.isValid()) return errno;
   } else {
-    if (errno != ENOENT) return errno;
-    if (const int error = findMissing(destination, &missing); error != 0) return error;
+    if (error != ENOENT) return error;
+    if (const int failed = findMissing(destination, &missing); failed != 0) return failed;
   }
 
   removeLeftovers(place.directory.get());

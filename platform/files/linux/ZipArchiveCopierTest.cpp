@@ -468,6 +468,19 @@ TEST_F(ZipArchiveCopierTest, EveryShorterArchiveIsRefused) {
   }
 }
 
+TEST_F(ZipArchiveCopierTest, ALinkThatSomebodyElseCanHaveMadeIsNoDestination) {
+  dir.directory("elsewhere");
+  const std::string archive = dir.file("archive.zip", ZipBuilder().file("a", "x").build());
+  dir.link("folder/out", dir / "elsewhere");
+  ASSERT_EQ(::chmod((dir / "folder").c_str(), 0777), 0);
+  EXPECT_EQ(copy(archive, dir / "folder/out"), EEXIST);
+  EXPECT_EQ(copy(archive, dir / "folder/out/below"), EEXIST);
+  EXPECT_TRUE(std::filesystem::is_empty(dir / "elsewhere"));
+  ASSERT_EQ(::chmod((dir / "folder").c_str(), 0755), 0);
+  EXPECT_EQ(copy(archive, dir / "folder/out"), 0);
+  EXPECT_EQ(contentOf(dir / "elsewhere/a"), "x");
+}
+
 TEST_F(ZipArchiveCopierTest, TheDestinationMustNotBeAFile) {
   dir.file("out", "kept");
   EXPECT_EQ(unpack(ZipBuilder().file("a", "x").build()), ENOTDIR);
