@@ -4,10 +4,52 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
 
 #include "helper/lasd/DatabaseTypes.h"
 #include "helper/lasd/LasdTestSupport.h"
 #include "platform/preferences/fakes/InMemoryPreferences.h"
+
+namespace brenvik {
+namespace {
+
+// Records what is synced while it stands: "path", of a file "path size", as it is at that moment.
+struct SyncRecord {
+  explicit SyncRecord(int errorOfFiles = 0) : error(errorOfFiles) { present = this; }
+  ~SyncRecord() { present = nullptr; }
+  SyncRecord(const SyncRecord&) = delete;
+  SyncRecord& operator=(const SyncRecord&) = delete;
+
+  // 0, or why a file is not synced.
+  int take(int file) {
+    struct stat status {};
+    const bool isFile = ::fstat(file, &status) == 0 && S_ISREG(status.st_mode);
+    synced.push_back(std::filesystem::read_symlink("/proc/self/fd/" + std::to_string(file)).string() +
+                     (isFile ? " " + std::to_string(status.st_size) : ""));
+    if (look) look();
+    return isFile ? error : 0;
+  }
+
+  static inline SyncRecord* present = nullptr;
+  const int error;
+  std::vector<std::string> synced;
+  std::function<void()> look;
+};
+
+}  // namespace
+}  // namespace brenvik
+
+// In place of the C library's in this program.
+extern "C" int fsync(int file) {
+  if (brenvik::SyncRecord::present != nullptr) {
+    errno = brenvik::SyncRecord::present->take(file);
+    if (errno != 0) return -1;
+  }
+  return static_cast<int>(::syscall(SYS_fsync, file));
+}
 
 namespace brenvik {
 namespace {
@@ -203,6 +245,35 @@ TEST_F(DatabaseInstallerTest, AFailedRenameSaysWhyAndKeepsTheTemporaryFile) {
   EXPECT_FALSE(installer.downloadAndInstall(kUrl, gsm, record));
   EXPECT_EQ(log.entries().back(), error("Could not rename " + at("gsm.db.tmp") + " to " + at("gsm.db") +
                                         ": No such file or directory"));
+  EXPECT_FALSE(recorded("gsm"));
+}
+
+TEST_F(DatabaseInstallerTest, TheWholeFileIsOnTheDiskBeforeItIsMovedInAndTheFolderBeforeTheRecordIsWritten) {
+  serveGzip(kUrl, "database");
+  SyncRecord syncs;
+  std::vector<std::string> there;
+  syncs.look = [&] {
+    const bool isMovedIn = std::filesystem::exists(at("gsm.db"));
+    there.push_back(std::string(isMovedIn ? "moved in" : "not yet") + (recorded("gsm") ? ", recorded" : ""));
+  };
+  EXPECT_TRUE(install());
+  EXPECT_EQ(syncs.synced, (std::vector<std::string>{at("gsm.db.tmp") + " 8", directory.string()}));
+  EXPECT_EQ(there, (std::vector<std::string>{"not yet", "moved in"}));
+  EXPECT_TRUE(recorded("gsm"));
+}
+
+TEST_F(DatabaseInstallerTest, AFileThatDoesNotReachTheDiskIsAFailureWithItsReason) {
+  serveGzip(kUrl, "database");
+  {
+    const SyncRecord failing(EIO);
+    EXPECT_FALSE(install());
+  }
+  expectLines(fetchLines(kUrl, gzipOf("database").size()),
+              {info("uncompressing to " + at("gsm.db.tmp")),
+               error("Cannot write output file " + at("gsm.db.tmp") + ": Input/output error"),
+               error("Could not uncompress HTTP response to " + at("gsm.db.tmp") + "!"),
+               error("Failed to commit the data to file for " + at("gsm.db.tmp"))});
+  EXPECT_EQ(files(), 0U);
   EXPECT_FALSE(recorded("gsm"));
 }
 

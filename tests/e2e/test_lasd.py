@@ -232,8 +232,19 @@ class Updates(UpdateTest):
         self.addCleanup(run, "umount", DIRECTORY)
         self.serve({"gsm": "1", "lte": "1"}, lambda name, version: bytes(1 << 27) if name == "gsm" else b"small")
         self.assertEqual(self.check(count=2), ["UpdateFailed", "UpdateAvailable lte"])
+        room = (24 << 20) - (24 << 20) // 50
+        self.logs.wait_for("unified", ERROR, f"No room for {DIRECTORY}/gsm.db.tmp: it needs {1 << 27} bytes or more, "
+                                             f"{room} are free beyond the reserve")
         self.logs.wait_for("unified", ERROR, f"Could not uncompress HTTP response to {DIRECTORY}/gsm.db.tmp!")
         self.assertEqual([f.name for f in DIRECTORY.iterdir()], ["lte.db"])
+
+    def test_a_disk_of_a_few_megabytes_takes_a_database(self):
+        DIRECTORY.mkdir()
+        network.run("mount", "-t", "tmpfs", "-o", "size=4m", "none", DIRECTORY)
+        self.addCleanup(network.run, "umount", DIRECTORY)
+        manifest = self.serve({"gsm": "1"}, lambda name, version: bytes(3 << 20))
+        self.assertEqual(self.check(), available(["gsm"]))
+        self.assert_installed(manifest, lambda name, version: bytes(3 << 20))
 
 
 class Failures(UpdateTest):
@@ -287,7 +298,7 @@ class Failures(UpdateTest):
     def test_oversized_body(self):
         self.restart(*self.good)
         with open(self.server.root / "1/v3/lasd.plist", "wb") as file:
-            file.truncate((512 << 20) + 1)
+            file.truncate((16 << 20) + 1)
         self.assert_check_fails("response too large", 200, "OK")
 
     def test_empty_body(self):

@@ -432,6 +432,31 @@ class WanIpTest(LocationTest):
         self.assertEqual(brenvik.wait_for(1), [address("203.0.113.9")])
         self.lines(("unified", ERROR, "geo service: ignored what does not answer the STUN request"))
 
+    def test_a_second_question_goes_out_at_once_and_its_answer_counts(self):
+        seen = []
+
+        def answer(request, sender):
+            if request not in seen:
+                seen.append(request)
+            return [self.seen_as("203.0.113.9", request)] if request != seen[0] else []
+
+        self.stun_server(answer)
+        brenvik = Brenvik(self)
+        client = self.client()
+        self.ask_wan_ip(client)
+        eventually(lambda: seen, what="the first question")
+        self.ask_wan_ip(client)
+        self.assertEqual(brenvik.wait_for(1), [address("203.0.113.9")])
+        self.assertEqual(len(seen), 2)
+
+    def test_an_answer_without_an_address_ends_at_once_by_the_error_road(self):
+        self.stun_server(lambda request, sender: [self.seen_as("0.1.2.3", request)])
+        brenvik = Brenvik(self)
+        self.ask_wan_ip(self.client())
+        self.assertEqual(brenvik.wait_for(1), [address("")])
+        self.lines(("unified", ERROR, "_RequestWanIPFromLocation error: (the STUN server's answer has no address)"),
+                   WAN_IP_SENT)
+
     def test_a_civic_answer_takes_the_flag_of_an_outstanding_address_request(self):
         brenvik = Brenvik(self)
         self.stun_server(lambda request, sender: [self.seen_as("203.0.113.9", request)] if brenvik.pushes else [])

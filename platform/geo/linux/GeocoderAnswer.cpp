@@ -9,8 +9,6 @@
 namespace brenvik {
 namespace {
 
-constexpr std::size_t kLongestPart = 1024;
-
 // The parts an address is read from. Of the four kinds of city the first that is there names it.
 constexpr std::array<std::string_view, 7> kParts{"country_code", "state",   "postcode",    "city",
                                                  "town",         "village", "municipality"};
@@ -48,8 +46,7 @@ class Reader final : public nlohmann::json_sax<nlohmann::json> {
   }
   bool string(string_t& value) override {
     if (part_ != nullptr && depth_ == 2) {
-      const bool usable =
-          !value.empty() && value.size() <= kLongestPart && value.find('\0') == string_t::npos;
+      const bool usable = !value.empty() && value.find('\0') == string_t::npos;
       *part_ = usable ? std::optional<std::string>(value) : std::nullopt;
     }
     return depth_ > 0;

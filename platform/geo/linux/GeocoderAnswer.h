@@ -19,8 +19,8 @@ struct GeocoderAnswer {
   std::optional<GeoError> error;             // the body is no such answer
 };
 
-// A part of the address that is not a text, is empty, longer than 1,024 bytes or holds a NUL counts as
-// absent, as does a country code of anything but two letters. Throws nothing but std::bad_alloc.
+// A part of the address that is not a text, is empty or holds a NUL counts as absent, as does a country code
+// of anything but two letters. Throws nothing but std::bad_alloc.
 GeocoderAnswer readGeocoderAnswer(std::string_view body);
 
 }  // namespace brenvik

@@ -24,6 +24,38 @@ std::string decimal(double degrees) {
   return {text.data(), end};
 }
 
+// What the parts of an address may take together in a push to the telephony daemon: a datagram of 65,536
+// bytes holds them beside the message and the keys, with some room to spare.
+constexpr std::size_t kMostOfAPush = 65'000;
+
+// In a binary property list: a byte a character, or UTF-16 for all of a text that is not ASCII.
+std::size_t sizeInAPush(const std::string& text) {
+  const auto units = [](char c) {
+    const auto byte = static_cast<unsigned char>(c);
+    return byte >= 0xF0 ? 2U : (byte & 0xC0U) == 0x80 ? 0U : 1U;
+  };
+  const bool isAscii = std::all_of(text.begin(), text.end(), [](char c) { return (c & 0x80) == 0; });
+  if (isAscii) return text.size();
+  std::size_t size = 0;
+  for (const char c : text) size += 2 * units(c);
+  return size;
+}
+
+// A part that does not fit any more counts as absent: without it the rest gets there.
+void fitIntoAPush(StructuredAddress& address) {
+  std::size_t taken = 0;
+  for (auto* const part :
+       {&address.countryCode, &address.postCode, &address.locality, &address.administrativeArea}) {
+    if (!*part) continue;
+    const std::size_t size = sizeInAPush(**part);
+    if (size > kMostOfAPush - taken) {
+      part->reset();
+    } else {
+      taken += size;
+    }
+  }
+}
+
 bool isCoordinate(const Coordinate& coordinate) {
   // Written so that a NaN fails it.
   return coordinate.latitude >= -90 && coordinate.latitude <= 90 && coordinate.longitude >= -180 &&
@@ -129,6 +161,7 @@ void ReverseGeocoder::answerOffline(Coordinate coordinate, const Deliver& delive
 void ReverseGeocoder::deliverAddress(std::optional<StructuredAddress> address, const Deliver& deliver) {
   MapItems items;
   if (address) {
+    fitIntoAPush(*address);
     if (address->countryCode) found_(*address->countryCode);
     items.emplace_back(MapItem{true, GeoAddress{std::move(address)}});
   }

@@ -124,6 +124,29 @@ TEST_F(ReverseGeocoderTest, TheServersAnswerIsTaken) {
   EXPECT_EQ(seen.bodySize, 0U);
 }
 
+TEST_F(ReverseGeocoderTest, PartsOfAnyLengthTravelWholeUpToWhatAPushCarries) {
+  const auto online = geocoder(kServer);
+  const auto answerWith = [&](const std::string& city, const std::string& state) {
+    web.answer(kOsloUrl, 200,
+               R"({"address":{"city":")" + city + R"(","state":")" + state +
+                   R"(","postcode":"0150","country_code":"no"}})");
+    pass(1s);
+    ask(online, kOslo);
+    return addressOf(answers.back());
+  };
+  const std::string city(30'000, 'c');
+  const std::string state(34'994, 's');  // beside them six bytes
+  EXPECT_EQ(answerWith(city, state).locality, city);
+  EXPECT_EQ(answerWith(city, state).administrativeArea, state);
+  EXPECT_EQ(answerWith(city, state + "s").locality, city);
+  EXPECT_EQ(answerWith(city, state + "s").administrativeArea, std::nullopt);
+  EXPECT_EQ(answerWith(city + "ø", "s").locality, city + "ø") << "60,002 bytes of UTF-16";
+  EXPECT_EQ(answerWith(city + city, "s").locality, city + city);
+  EXPECT_EQ(answerWith(city + city + "ø", "s").locality, std::nullopt) << "120,002";
+  EXPECT_EQ(answerWith(std::string(70'000, 'c'), "s").postCode, "0150");
+  EXPECT_EQ(answerWith(std::string(70'000, 'c'), "s").administrativeArea, "s");
+}
+
 TEST_F(ReverseGeocoderTest, CoordinatesAreSentWithoutExponent) {
   const auto online = geocoder(kServer);
   ask(online, {1e-300, -179.99999999});

@@ -352,6 +352,24 @@ TEST_F(ChannelTelephonyDaemonTest, ADaemonThatAcceptsNobodyCostsNoMoreThanThePat
   EXPECT_GE(Clock::now() - before, 50ms);
 }
 
+TEST_F(ChannelTelephonyDaemonTest, CivicInfoOf65000BytesFitsADatagram) {
+  service.listen();
+  ChannelTelephonyDaemon daemon(service.directory, 60s);
+  daemon.addIdentifierException("BrenvikMobileHelper");
+  Received request;
+  std::thread brenvik([&] {
+    const UniqueFd channel = service.accept();
+    request = receive(channel);
+    sendReply(channel, replyTo(request));
+  });
+  const std::string state(32'495, 's');
+  const std::string city(32'495, 'c');
+  EXPECT_EQ(daemon.create({})->setCivicInfoBasedOnCurrentLocation("NO", state, city, "01234567"), 0U);
+  brenvik.join();
+  EXPECT_EQ(request.values().find("State").asString(), state);
+  EXPECT_EQ(request.values().find("City").asString(), city);
+}
+
 TEST_F(ChannelTelephonyDaemonTest, APushThatFitsNoDatagramIsRefusedHere) {
   service.listen();
   ChannelTelephonyDaemon daemon(service.directory, 60s);

@@ -163,6 +163,13 @@ class HttpsServer {
 
   HttpsServer(const Identity& identity, Script script)
       : HttpsServer(&identity, std::move(script), Wire::tls) {}
+  // Speaks this version of TLS (TLS1_1_VERSION ...) and no other, however old it is.
+  HttpsServer(const Identity& identity, Script script, int onlyVersion)
+      : HttpsServer(&identity, std::move(script), Wire::tls) {
+    SSL_CTX_set_security_level(context_.get(), 0);
+    SSL_CTX_set_min_proto_version(context_.get(), onlyVersion);
+    SSL_CTX_set_max_proto_version(context_.get(), onlyVersion);
+  }
   // Without TLS, whatever the client expects.
   HttpsServer(Script script, Wire wire) : HttpsServer(nullptr, std::move(script), wire) {}
   HttpsServer(const HttpsServer&) = delete;

@@ -5,8 +5,10 @@
 #include <gtest/gtest.h>
 #include <zlib.h>
 
+#include <array>
 #include <atomic>
 #include <csignal>
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <future>
@@ -431,6 +433,62 @@ TEST_F(CurlWebClientTest, AServerWithoutTlsIsNoSecureConnection) {
   HttpsServer server([](Connection& connection) { connection.respond("200 OK", "plain"); },
                      HttpsServer::Wire::plain);
   expectKind(WebErrorKind::secureConnection, fetch(server.url()));
+}
+
+TEST_F(CurlWebClientTest, Tls11IsRefusedEvenWhereTheSystemAllowsIt) {
+  // The system's own configuration refuses it as well, so the test has one that does not. It is read once a
+  // process.
+  const std::string lenient = folder / "openssl.cnf";
+  std::ofstream(lenient) << "openssl_conf = all\n[all]\nssl_conf = ssl\n[ssl]\nsystem_default = lenient\n"
+                            "[lenient]\nMinProtocol = TLSv1\nCipherString = DEFAULT@SECLEVEL=0\n";
+  ASSERT_EQ(::setenv("OPENSSL_CONF", lenient.c_str(), 1), 0);
+  testing::FLAGS_gtest_death_test_style = "threadsafe";
+  const auto kindWith = [&](int version) {
+    HttpsServer server(
+        identity,
+        [](Connection& connection) {
+          connection.readRequest();
+          connection.respond("200 OK", "x");
+        },
+        version);
+    return static_cast<int>(fetch(server.url())->errorKind);
+  };
+  EXPECT_EXIT(std::_Exit(100 + kindWith(TLS1_1_VERSION)),
+              testing::ExitedWithCode(100 + static_cast<int>(WebErrorKind::secureConnection)), "");
+  EXPECT_EXIT(std::_Exit(100 + kindWith(TLS1_2_VERSION)),
+              testing::ExitedWithCode(100 + static_cast<int>(WebErrorKind::none)), "");
+  ::unsetenv("OPENSSL_CONF");
+}
+
+TEST_F(CurlWebClientTest, WithoutCellularTheConnectionIsBoundToTheInterfaceThatWasApproved) {
+  std::promise<void> reached;
+  HttpsServer server(identity, [&](Connection& connection) {
+    connection.readRequest();
+    reached.set_value();
+    connection.stall();
+  });
+  // The interface that this process's connections to the server are bound to.
+  const auto boundTo = [&] {
+    std::vector<std::string> names;
+    for (int fd = 0; fd < 1024; ++fd) {
+      sockaddr_in peer{};
+      socklen_t size = sizeof peer;
+      if (::getpeername(fd, reinterpret_cast<sockaddr*>(&peer), &size) != 0) continue;
+      if (peer.sin_family != AF_INET || ntohs(peer.sin_port) != server.port()) continue;
+      std::array<char, 64> name{};
+      size = name.size();
+      EXPECT_EQ(::getsockopt(fd, SOL_SOCKET, SO_BINDTODEVICE, name.data(), &size), 0);
+      names.emplace_back(name.data());
+    }
+    return names;
+  };
+  Options options;
+  options.cellularAllowed = false;
+  auto answer = start(server.url("/", "127.0.0.1"), options);
+  reached.get_future().wait();
+  EXPECT_EQ(boundTo(), std::vector<std::string>{"lo"});
+  client.reset();
+  expectKind(WebErrorKind::cancelled, answer.get());
 }
 
 TEST_F(CurlWebClientTest, WhatIsNotHttpIsMalformed) {
