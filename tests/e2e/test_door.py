@@ -59,8 +59,10 @@ class HangingFiles:
         return struct.pack("<QQQQQQIIIIIIIIII", node, 0, 0, 0, 0, 0, 0, 0, 0, mode, 1, 602, 602, 0, 4096, 0)
 
     def end(self):
-        os.close(self.device)  # the connection breaks, and whoever waits for an answer goes on
-        ctypes.CDLL(None).umount2(self.folder.encode(), 2)
+        force, detach = 1, 2  # the connection breaks, and whoever waits for an answer goes on
+        ctypes.CDLL(None).umount2(self.folder.encode(), force | detach)
+        self.thread.join()
+        os.close(self.device)
 
 
 def lingering_socket():
