@@ -253,7 +253,8 @@ class Door(HelperTest):
 
     def test_out_of_descriptors_an_entitled_caller_is_answered_6_with_a_line(self):
         top = max(int(number) for number in os.listdir(f"/proc/{self.daemon.pid}/fd")) + 1
-        resource.prlimit(self.daemon.pid, resource.RLIMIT_NOFILE, (top, top))
+        before = resource.prlimit(self.daemon.pid, resource.RLIMIT_NOFILE)
+        resource.prlimit(self.daemon.pid, resource.RLIMIT_NOFILE, (top, before[1]))
         clients, codes = [], []
         for _ in range(20):
             try:
@@ -266,7 +267,7 @@ class Door(HelperTest):
         self.logs.wait_for("unified", ERROR, CHECK_IN_REFUSED)
         for client in clients:
             self.assertEqual(client.copy_preference("com.example.none", "key"), b"")
-        resource.prlimit(self.daemon.pid, resource.RLIMIT_NOFILE, (top + 100, top + 100))
+        resource.prlimit(self.daemon.pid, resource.RLIMIT_NOFILE, before)
         wire.Client().close()
 
     def test_4000_clients_fit_and_are_all_served(self):

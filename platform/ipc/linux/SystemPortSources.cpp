@@ -509,6 +509,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
       (void)keepReserve();
       return false;
     }
+    reserve_ = {};  // the first line of a log takes a descriptor, too
     logUnified(LogLevel::error, "out of descriptors or memory: a check-in was refused");
     return true;
   }
