@@ -580,6 +580,9 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
       }
       if (errno == EINTR || errno == ECONNABORTED) continue;
       if (errno != EMFILE && errno != ENFILE) return true;
+      // The kernel looks for a descriptor before it looks whether anybody waits.
+      pollfd waiting{listening_->get(), POLLIN, 0};
+      if (::poll(&waiting, 1, 0) == 0) return true;
       // A stranger gives its place up, or else the reserve does: then this one gets an answer at least.
       if (drop(books_.oldestStranger())) continue;
       if (!reserve_.front().isValid()) return false;
