@@ -71,7 +71,7 @@ struct Server {
   std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
   SystemPortSpace ports;
   SystemRegions regions;
-  SystemPortSources sources{ports, regions};
+  SystemPortSources sources{ports, regions, SystemPortSources::Refusals::unlimited};
   AbstractBootstrap bootstrap{ports};
   NoRoutines routines;
   bool admits = false;
