@@ -4,7 +4,8 @@
 // What a client waits for, everything on one processor: a call to the real daemon beside a bare blocking
 // ping-pong over the same kind of socket and beside sd-bus, peer to peer; a reply with a region of all that
 // fits a datagram, through the real transport, beside a bare one of the same bytes; and the time from the
-// start of the daemon to its first answer, beside a bare server that needs the C library alone.
+// start of the daemon to its first answer, beside a bare server that needs the C library alone; and a call to
+// a daemon that has 4,000 clients beside one that has this client alone.
 //
 // The daemon and the bare server are programs of this build, started as a service manager starts them. The
 // daemon admits this program by an entitlement file that is written for the time being, so it wants the
@@ -16,6 +17,7 @@
 #include <signal.h>
 #include <stdlib.h>
 #include <sys/prctl.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -51,6 +53,8 @@ constexpr double kMostOfBare = 1.25;
 constexpr double kMostOfBus = 0.55;
 constexpr double kMostOfBareRegion = 1.15;
 constexpr double kMostOfBareStart = 1.35;
+constexpr double kMostOfOneClient = 1.1;  // a call of one among many, beside a call of the only one
+constexpr std::size_t kManyClients = 4000;
 
 constexpr const char kEntitlementFile[] = "/etc/brenvik/entitlements.d/50-transport-benchmark.plist";
 
@@ -115,7 +119,8 @@ class ServedProgram {
     const UniqueFd service(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
     require(::connect(service.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0,
             "connect");
-    ::unlink(path.c_str());
+    address_ = address;
+    path_ = path;
     std::array<int, 2> life{};
     require(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, life.data()) == 0, "socketpair");
     life_ = UniqueFd(life[0]);
@@ -127,11 +132,25 @@ class ServedProgram {
     untilFirstReply_ = microsecondsSince(before);
   }
   ~ServedProgram() {
+    ::unlink(path_.c_str());
     ::kill(process_, SIGKILL);
     ::waitpid(process_, nullptr, 0);
   }
   ServedProgram(const ServedProgram&) = delete;
   ServedProgram& operator=(const ServedProgram&) = delete;
+
+  std::size_t clients() const { return 1 + others_.size() / 2; }
+  // Checks in once more and keeps the client.
+  void addClient() {
+    const UniqueFd service(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+    require(::connect(service.get(), reinterpret_cast<const sockaddr*>(&address_), sizeof address_) == 0,
+            "connect");
+    std::array<int, 2> life{};
+    require(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, life.data()) == 0, "socketpair");
+    others_.emplace_back(life[0]);
+    sendCheckIn(service.get(), UniqueFd(life[1]));
+    others_.push_back(receiveCheckInReply(service.get()));
+  }
 
   double untilFirstReply() const { return untilFirstReply_; }  // microseconds, from the start of the program
 
@@ -198,8 +217,11 @@ class ServedProgram {
     require(process_ > 0, "vfork");
   }
 
+  std::string path_;
+  sockaddr_un address_{};
   UniqueFd life_;
   UniqueFd channel_;
+  std::vector<UniqueFd> others_;
   pid_t process_ = -1;
   double untilFirstReply_ = 0;
 };
@@ -317,6 +339,30 @@ bool compareCalls(const std::string& daemonPath, const std::string& barePath, in
                        {{0, 1, kMostOfBare}, {0, 2, kMostOfBus}});
 }
 
+bool compareManyClients(const std::string& daemonPath, int rounds) {
+  rlimit descriptors{};
+  require(::getrlimit(RLIMIT_NOFILE, &descriptors) == 0, "getrlimit");
+  descriptors.rlim_cur = descriptors.rlim_max;
+  require(::setrlimit(RLIMIT_NOFILE, &descriptors) == 0, "setrlimit");
+  ServedProgram one(daemonPath);
+  ServedProgram many(daemonPath);
+  const auto before = Clock::now();
+  while (many.clients() < kManyClients) many.addClient();
+  std::printf("%-44s %9.2f us\n", "a check-in, the mean of 4,000",
+              microsecondsSince(before) / static_cast<double>(kManyClients));
+  String256Request request{};
+  request.header = {kReplyDisposition, sizeof request, 1, 0, 0, kFirstRequestId};
+  request.ndr = kNdrRecord;
+  request.text[0] = '\xFF';
+  const auto callOf = [&request](ServedProgram& server) {
+    return [&] { return server.exchange(&request, sizeof request, sizeof(StatusReply)); };
+  };
+  return comparePaired(
+      {.rounds = rounds, .unmeasured = 50, .measured = 1000},
+      {{"call of one client among 4,000", callOf(many)}, {"call of the only client", callOf(one)}},
+      {{0, 1, kMostOfOneClient}});
+}
+
 bool compareRegions(const std::string& barePath, int rounds) {
   TableServer ours(
       [](const TableServer::Surroundings& here, const auto& serve) { serve(RegionTable(here.regions)); });
@@ -352,8 +398,9 @@ int main(int argc, char** argv) {
   using namespace brenvik;
   const int rounds = argc > 1 ? std::atoi(argv[1]) : 25;
   const std::string_view only = argc > 2 ? argv[2] : "";
-  if (rounds < 1 || !(only.empty() || only == "calls" || only == "regions" || only == "starts")) {
-    std::fprintf(stderr, "usage: TransportBenchmark [ROUNDS [calls | regions | starts]]\n");
+  if (rounds < 1 ||
+      !(only.empty() || only == "calls" || only == "regions" || only == "starts" || only == "clients")) {
+    std::fprintf(stderr, "usage: TransportBenchmark [ROUNDS [calls | regions | starts | clients]]\n");
     return 2;
   }
   pinToOneProcessor();
@@ -364,5 +411,6 @@ int main(int argc, char** argv) {
   const bool calls = !isWanted("calls") || compareCalls(daemon, bare, rounds);
   const bool regions = !isWanted("regions") || compareRegions(bare, rounds);
   const bool starts = !isWanted("starts") || compareStarts(daemon, bare, rounds);
-  return calls && regions && starts ? 0 : 1;
+  const bool clients = !isWanted("clients") || compareManyClients(daemon, rounds);
+  return calls && regions && starts && clients ? 0 : 1;
 }

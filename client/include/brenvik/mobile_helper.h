@@ -113,9 +113,9 @@ BVMH_API const char* bvmh_bootstrap_directory(void);
 /*
  * Connects to the helper and checks in; it does nothing when that was done already. When the helper stopped
  * before it answered, it is tried again, for about a second and never beyond the time-out.
- * BVMH_INVALID_SECURITY: the helper refused this program. With EACCES in bvmh_client_errno the kernel did: the
- * account must join the group that may connect ("brenvik"; usermod -aG brenvik ACCOUNT), log in anew, and then be
- * entitled. BVMH_ERROR_UNREACHABLE: no helper.
+ * BVMH_INVALID_SECURITY: the helper refused this program. With EACCES in bvmh_client_errno the kernel did:
+ * the account must join the group that may connect ("brenvik"; usermod -aG brenvik ACCOUNT), log in anew, and
+ * then be entitled. BVMH_ERROR_UNREACHABLE: no helper.
  */
 BVMH_API BVMH_CHECKED int32_t bvmh_connect(bvmh_client* client);
 /* Leaves the helper. Answers still to come are lost. */

@@ -437,15 +437,16 @@ class PortSource final : public RoutineSource, private ChannelOwner {
 class ServiceSource final : public RoutineSource, private ChannelOwner {
  public:
   ServiceSource(PortName port, const RoutineTable& table, WantTrailer trailer, SystemPortSpace& ports,
-                SystemRegions& regions, IncomingMessage& incoming,
-                SystemPortSpace::SharedFd listening) noexcept
+                SystemRegions& regions, IncomingMessage& incoming, SystemPortSpace::SharedFd listening,
+                SystemPortSources::Refusals limits) noexcept
       : port_(port),
         table_(table),
         trailer_(trailer),
         ports_(ports),
         regions_(regions),
         incoming_(incoming),
-        listening_(std::move(listening)) {}
+        listening_(std::move(listening)),
+        limits_(limits) {}
   ~ServiceSource() override { invalidate(); }
 
   bool addTo(RunLoop& loop) noexcept override {
@@ -502,13 +503,14 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   }
 
   bool endService(Channel& channel, KernelReturn code) noexcept override {
-    if (code == kern::invalidSecurity) {
+    if (code == kern::invalidSecurity && limits_ == SystemPortSources::Refusals::limited) {
       refusals_.refused(channel.account(), std::chrono::steady_clock::now());
     }
     if (code != kern::resourceShortage) {
       (void)keepReserve();
       return false;
     }
+    reserve_ = {};  // the first line of a log takes a descriptor, too
     logUnified(LogLevel::error, "out of descriptors or memory: a check-in was refused");
     return true;
   }
@@ -579,6 +581,9 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
       }
       if (errno == EINTR || errno == ECONNABORTED) continue;
       if (errno != EMFILE && errno != ENFILE) return true;
+      // The kernel looks for a descriptor before it looks whether anybody waits.
+      pollfd waiting{listening_->get(), POLLIN, 0};
+      if (::poll(&waiting, 1, 0) == 0) return true;
       // A stranger gives its place up, or else the reserve does: then this one gets an answer at least.
       if (drop(books_.oldestStranger())) continue;
       if (!reserve_.front().isValid()) return false;
@@ -668,6 +673,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   bool hasLimited_ = false;
   bool isFullTold_ = false;
   bool isAcceptingPaused_ = false;
+  const SystemPortSources::Refusals limits_;
   RefusalLimit refusals_;
   ConnectionBooks books_;
   std::unordered_map<Channel*, std::shared_ptr<Channel>> channels_;
@@ -714,8 +720,11 @@ class SocketDeathWatch final : public DeathWatch {
 
 }  // namespace
 
-SystemPortSources::SystemPortSources(SystemPortSpace& ports, SystemRegions& regions)
-    : ports_(ports), regions_(regions), incoming_(std::make_unique<IncomingMessage>(ports)) {}
+SystemPortSources::SystemPortSources(SystemPortSpace& ports, SystemRegions& regions, Refusals refusals)
+    : ports_(ports),
+      regions_(regions),
+      refusals_(refusals),
+      incoming_(std::make_unique<IncomingMessage>(ports)) {}
 
 SystemPortSources::~SystemPortSources() = default;
 
@@ -726,7 +735,7 @@ std::shared_ptr<RoutineSource> SystemPortSources::makeRoutineSource(PortName por
   try {
     if (ports_.isService(port)) {
       return std::make_shared<ServiceSource>(port, table, trailer, ports_, regions_, *incoming_,
-                                             std::move(end));
+                                             std::move(end), refusals_);
     }
     auto source = std::make_shared<PortSource>(port, table, trailer);
     source->setChannel(ports_, regions_, *incoming_, std::move(end));

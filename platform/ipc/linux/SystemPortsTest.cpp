@@ -1212,6 +1212,20 @@ TEST_F(ServiceTest, WithoutDescriptorsACheckInIsAnsweredWith6AndALineAndNobodySp
   EXPECT_EQ(answer->code(), 0);
 }
 
+TEST_F(ServiceTest, WithoutDescriptorsAConnectionIsKeptUntilItsCheckInComes) {
+  listen();
+  const UniqueFd connection = connect();
+  const DescriptorShortage shortage(0);
+  pump();
+  loop->run(1s, ReturnAfterSource::yes);  // looks again whether somebody waits
+  EXPECT_FALSE(isClosed(connection));
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  pump();
+  const auto answer = receiveFrom(connection.get());
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->code(), kern::resourceShortage);
+}
+
 TEST_F(ServiceTest, WhoeverIsServedFindsDescriptorsForALook) {
   listen();
   const UniqueFd connection = connect();
