@@ -270,6 +270,7 @@ TEST_F(SystemQueuesTest, ATimerThatIsDueFiresAlsoInARunThatMayNotWait) {
 }
 
 TEST_F(SystemQueuesTest, TimersCountTheTimeThatTheSystemSleeps) {
+  const auto timer = loop->addTimer(1h, 0s, [] {}, {});
   // What the kernel says of the one clock that this process has (proc(5)).
   std::vector<std::string> clocks;
   for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fdinfo")) {
@@ -515,6 +516,17 @@ TEST_F(SystemQueuesTest, WithoutDescriptorsAndReserveMakingAQueueFailsAndIsNoOth
   }
   EXPECT_THROW((void)queues.global(), std::bad_alloc);
   EXPECT_TRUE(works(*made.front()));
+}
+
+TEST_F(SystemQueuesTest, WithoutADescriptorForTheClockATimerIsNotMadeAndTheNextOneIs) {
+  bool fired = false;
+  {
+    const NoDescriptors none;
+    EXPECT_EQ(loop->addTimer(0s, 0s, [] { ADD_FAILURE() << "fired"; }, {}), nullptr);
+  }
+  const auto timer = loop->addTimer(0s, 0s, [&] { fired = true; }, {});
+  EXPECT_NE(timer, nullptr);
+  runUntil([&] { return fired; });
 }
 
 // From now on this process can start neither thread nor process.
