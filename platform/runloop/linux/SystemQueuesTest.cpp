@@ -134,6 +134,23 @@ TEST_F(SystemQueuesTest, ADescriptorThatIsReadyIsServedBeforeATimerThatIsDue) {
   EXPECT_EQ(order, "dt");
 }
 
+TEST_F(SystemQueuesTest, ADescriptorIsServedBeforeATimerThatWasDueWhenItBecameReady) {
+  const UniqueFd ready(::eventfd(0, EFD_CLOEXEC));
+  std::string order;
+  const auto timer = loop->addTimer(500ms, 0s, [&] { order += 't'; }, {});
+  std::unique_ptr<DescriptorSource> source;
+  source = loop->addDescriptor(ready.get(), EPOLLIN, [&](std::uint32_t) {
+    order += 'd';
+    source.reset();
+  });
+  // The clock runs down in the kernel while nobody waits for it; only then does the descriptor become ready.
+  ASSERT_EQ(loop->run(0s, ReturnAfterSource::no), RunResult::timedOut);
+  std::this_thread::sleep_for(550ms);
+  ASSERT_EQ(::eventfd_write(ready.get(), 1), 0);
+  runUntil([&] { return order.size() == 2; });
+  EXPECT_EQ(order, "dt");
+}
+
 TEST_F(SystemQueuesTest, DescriptorsThatAreAlwaysReadyTakeTurns) {
   const UniqueFd first(::eventfd(1, EFD_CLOEXEC));
   const UniqueFd second(::eventfd(1, EFD_CLOEXEC));
