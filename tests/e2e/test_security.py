@@ -5,14 +5,16 @@ import hashlib
 import os
 import pathlib
 import plistlib
+import re
 import shutil
 import socket
 import sys
 import time
+import unittest
 
 import wire
-from harness import (ALLOW, BUILD, ENTITLEMENTS, ERROR, LOG_ERR, Daemon, HelperTest, as_account, entitle, eventually,
-                     in_a_new_process, main, refused_with)
+from harness import (ALLOW, BUILD, ENTITLEMENTS, ERROR, LOG_ERR, SANITIZED, Daemon, HelperTest, as_account, entitle,
+                     eventually, in_a_new_process, main, refused_with)
 
 SYSTEM_BUS = pathlib.Path("/run/dbus/system_bus_socket")
 HOSTED = "libbrenvik-baseband-helper.so.0"
@@ -124,6 +126,16 @@ class EntitlementFiles(HelperTest):
 class RadioLogs(HelperTest):
     def enable(self, client, value):
         self.assertEqual(client.status("EnableRadioManagerLogs", value.to_bytes(4, "little", signed=True)), 0)
+
+    @unittest.skipIf(SANITIZED, "a sanitizer brings libraries of its own")
+    def test_what_speaks_to_the_bus_is_loaded_with_the_first_request_and_nothing_but_the_language_before(self):
+        client = self.client()
+        libraries = set(re.findall(r"/(\w[^/\s]*\.so)\b", self.daemon.maps()))
+        self.assertLessEqual(libraries, {"libc.so", "libm.so", "libstdc++.so", "libgcc_s.so", "ld-linux-x86-64.so",
+                                         "ld-linux-aarch64.so"})
+        self.assertIn("libc.so", libraries)
+        self.enable(client, 1)
+        eventually(lambda: "libsystemd.so" in self.daemon.maps(), what="the library")
 
     def test_without_a_bus_there_is_nothing_but_the_line_with_the_value_as_received(self):
         client = self.client()
