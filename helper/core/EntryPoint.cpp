@@ -9,13 +9,6 @@
 #include "platform/log/Log.h"
 
 namespace brenvik {
-namespace {
-
-void logFailureToStart() noexcept {
-  logUnified(LogLevel::error, "unable to startup BrenvikMobileHelper server");
-}
-
-}  // namespace
 
 int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests,
               const std::function<void()>& endWork) {
@@ -43,7 +36,7 @@ int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const R
   }
 
   if (hosted != nullptr) hosted->stop();
-  if (status != 0) logFailureToStart();
+  if (status != 0) logUnified(LogLevel::error, "unable to startup BrenvikMobileHelper server");
   return status;
 }
 
@@ -51,7 +44,7 @@ int runReportingFailure(const std::function<int()>& work) noexcept {
   try {
     return work();
   } catch (...) {
-    logFailureToStart();
+    logUnified(LogLevel::error, "unable to startup BrenvikMobileHelper server");
     return 1;
   }
 }

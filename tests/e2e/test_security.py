@@ -8,6 +8,7 @@ import os
 import pathlib
 import plistlib
 import pwd
+import re
 import shutil
 import signal
 import socket
@@ -15,10 +16,11 @@ import subprocess
 import sys
 import threading
 import time
+import unittest
 
 import wire
-from harness import (ALLOW, BUILD, DEFAULT, ENTITLEMENTS, ERROR, INFO, LOG_ERR, SOCKET, Daemon, HelperTest, as_account,
-                     entitle, eventually, in_a_new_process, main, refused_with)
+from harness import (ALLOW, BUILD, DEFAULT, ENTITLEMENTS, ERROR, INFO, LOG_ERR, SANITIZED, SOCKET, Daemon, HelperTest,
+                     as_account, entitle, eventually, in_a_new_process, main, refused_with)
 
 SYSTEM_BUS = pathlib.Path("/run/dbus/system_bus_socket")
 HOSTED = "libbrenvik-baseband-helper.so.0"
@@ -411,6 +413,16 @@ class Access(HelperTest):
 class RadioLogs(HelperTest):
     def enable(self, client, value):
         self.assertEqual(client.status("EnableRadioManagerLogs", value.to_bytes(4, "little", signed=True)), 0)
+
+    @unittest.skipIf(SANITIZED, "a sanitizer brings libraries of its own")
+    def test_what_speaks_to_the_bus_is_loaded_with_the_first_request_and_nothing_but_the_language_before(self):
+        client = self.client()
+        libraries = set(re.findall(r"/(\w[^/\s]*\.so)\b", self.daemon.maps()))
+        self.assertLessEqual(libraries, {"libc.so", "libm.so", "libstdc++.so", "libgcc_s.so", "ld-linux-x86-64.so",
+                                         "ld-linux-aarch64.so"})
+        self.assertIn("libc.so", libraries)
+        self.enable(client, 1)
+        eventually(lambda: "libsystemd.so" in self.daemon.maps(), what="the library")
 
     def test_without_a_bus_there_is_nothing_but_the_line_with_the_value_as_received(self):
         client = self.client()

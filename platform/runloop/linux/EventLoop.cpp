@@ -164,10 +164,7 @@ std::shared_ptr<EventLoop> EventLoop::make(For whom) try {
     raw->drainInbox();
   });
   if (loop->wakeSource_ == nullptr) return nullptr;
-  loop->clockFd_.reset(::timerfd_create(kClock, TFD_CLOEXEC | TFD_NONBLOCK));
-  if (!loop->clockFd_.isValid()) return nullptr;
-  loop->clockSource_ = loop->addDescriptor(loop->clockFd_.get(), EPOLLIN, [](std::uint32_t) {});
-  if (loop->clockSource_ == nullptr) return nullptr;
+  if (whom == For::anotherThread && !loop->makeClock()) return nullptr;
   return loop;
 } catch (const std::bad_alloc&) {
   return nullptr;
@@ -175,13 +172,23 @@ std::shared_ptr<EventLoop> EventLoop::make(For whom) try {
 
 EventLoop::~EventLoop() = default;
 
+bool EventLoop::makeClock() {
+  if (clockSource_ != nullptr) return true;
+  clockFd_.reset(::timerfd_create(kClock, TFD_CLOEXEC | TFD_NONBLOCK));
+  if (!clockFd_.isValid()) return false;
+  auto source = std::make_unique<Descriptor>(descriptors_, clockFd_.get(), [](std::uint32_t) {});
+  if (!source->watch(EPOLLIN)) return false;
+  clockEntry_ = source->entry();
+  clockSource_ = std::move(source);
+  return true;
+}
+
 bool EventLoop::onLoopThread() const noexcept {
   return thread_.load(std::memory_order_relaxed) == std::this_thread::get_id();
 }
 
 int EventLoop::runOnce(std::uint64_t timeOut) noexcept {
   thread_.store(std::this_thread::get_id(), std::memory_order_relaxed);
-  const auto* const clock = static_cast<const Descriptor*>(clockSource_.get())->entry();
   for (;;) {
     setClock();
     // One at a time: what is ready and not handled now goes to the end of the kernel's queue, and a handler
@@ -202,7 +209,7 @@ int EventLoop::runOnce(std::uint64_t timeOut) noexcept {
       drainInbox();
       return 1;
     }
-    if (ready.data.ptr == clock) {
+    if (ready.data.ptr == clockEntry_) {
       // A descriptor that is ready at the same moment goes first: a check-in that has arrived beats the idle
       // countdown. They are all ahead of the clock in the kernel's queue, which has put it at the end: when
       // it comes round, each has had its turn.
@@ -291,6 +298,7 @@ std::unique_ptr<DescriptorSource> EventLoop::addDescriptor(int fd, std::uint32_t
 
 bool EventLoop::arm(const std::shared_ptr<Timer>& timer) noexcept {
   try {
+    if (!makeClock()) return false;
     timers_.add(timer);
     return true;
   } catch (const std::bad_alloc&) {

@@ -24,9 +24,10 @@ namespace brenvik {
 // The thread that calls runOnce() is the loop's thread.
 class EventLoop : public std::enable_shared_from_this<EventLoop> {
  public:
-  // Which thread owns the loop before its first runOnce(): the one that makes it, or one to be started.
+  // Which thread owns the loop before its first runOnce(): the one that makes it, or one to be started. A
+  // loop for another thread takes all the descriptors that it needs for itself at once; this thread's takes
+  // the last of them, the clock's, with its first timer.
   enum class For { thisThread, anotherThread };
-  // What a loop needs for itself; it takes all of them when it is made.
   static constexpr int kDescriptors = 3;
 
   // Null when the system is out of descriptors or memory.
@@ -69,6 +70,7 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
 
   EventLoop() = default;
   void drainInbox() noexcept;
+  bool makeClock();
   void setClock() noexcept;
   bool handleTimer() noexcept;
   bool arm(const std::shared_ptr<Timer>& timer) noexcept;
@@ -79,6 +81,7 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   std::unique_ptr<DescriptorSource> wakeSource_;
   UniqueFd clockFd_;
   std::unique_ptr<DescriptorSource> clockSource_;
+  const void* clockEntry_ = nullptr;  // what epoll knows it by
   // Loop thread only: the timers that run; what the timerfd is set to; and whether it has been seen to be
   // due, so that it is the timers' turn when it comes round again.
   TimerHeap<Timer> timers_;

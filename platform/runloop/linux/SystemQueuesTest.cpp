@@ -136,6 +136,23 @@ TEST_F(SystemQueuesTest, ADescriptorThatIsReadyIsServedBeforeATimerThatIsDue) {
   EXPECT_EQ(order, "dt");
 }
 
+TEST_F(SystemQueuesTest, ADescriptorIsServedBeforeATimerThatWasDueWhenItBecameReady) {
+  const UniqueFd ready(::eventfd(0, EFD_CLOEXEC));
+  std::string order;
+  const auto timer = loop->addTimer(500ms, 0s, [&] { order += 't'; }, {});
+  std::unique_ptr<DescriptorSource> source;
+  source = loop->addDescriptor(ready.get(), EPOLLIN, [&](std::uint32_t) {
+    order += 'd';
+    source.reset();
+  });
+  // The clock runs down in the kernel while nobody waits for it; only then does the descriptor become ready.
+  ASSERT_EQ(loop->run(0s, ReturnAfterSource::no), RunResult::timedOut);
+  std::this_thread::sleep_for(550ms);
+  ASSERT_EQ(::eventfd_write(ready.get(), 1), 0);
+  runUntil([&] { return order.size() == 2; });
+  EXPECT_EQ(order, "dt");
+}
+
 TEST_F(SystemQueuesTest, DescriptorsThatAreAlwaysReadyTakeTurns) {
   const UniqueFd first(::eventfd(1, EFD_CLOEXEC));
   const UniqueFd second(::eventfd(1, EFD_CLOEXEC));
@@ -272,6 +289,7 @@ TEST_F(SystemQueuesTest, ATimerThatIsDueFiresAlsoInARunThatMayNotWait) {
 }
 
 TEST_F(SystemQueuesTest, TimersCountTheTimeThatTheSystemSleeps) {
+  const auto timer = loop->addTimer(1h, 0s, [] {}, {});
   // What the kernel says of the one clock that this process has (proc(5)).
   std::vector<std::string> clocks;
   for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fdinfo")) {
@@ -575,6 +593,17 @@ TEST_F(SystemQueuesTest, WithoutDescriptorsAndReserveMakingAQueueFailsAndIsNoOth
   }
   EXPECT_THROW((void)queues.global(), std::bad_alloc);
   EXPECT_TRUE(works(*made.front()));
+}
+
+TEST_F(SystemQueuesTest, WithoutADescriptorForTheClockATimerIsNotMadeAndTheNextOneIs) {
+  bool fired = false;
+  {
+    const NoDescriptors none;
+    EXPECT_EQ(loop->addTimer(0s, 0s, [] { ADD_FAILURE() << "fired"; }, {}), nullptr);
+  }
+  const auto timer = loop->addTimer(0s, 0s, [&] { fired = true; }, {});
+  EXPECT_NE(timer, nullptr);
+  runUntil([&] { return fired; });
 }
 
 // From now on this process can start neither thread nor process.
