@@ -1109,6 +1109,40 @@ TEST_F(ExplanationTest, AFileThatIsPassedOverIsNamedWithWhatIsWrong) {
   EXPECT_THAT(log.entries(), IsEmpty()) << "a search that explains logs nothing";
 }
 
+TEST_F(MadeUpProcessTest, ACallerThatBecomesAnotherProgramWhileItIsExplainedIsToldAsSuch) {
+  for (const char* const name : {"etc/a.plist", "etc/b.plist"}) {
+    grant(name, "<true/>", quoted("User", "keeper") + quoted("Unit", "other.service"));
+  }
+  accounts.accounts["keeper"] = {AccountIds{0, 0}, std::nullopt};
+  auto files = makeFiles((root / "proc").string());
+  const auto task = files.makeTask(token);
+  ASSERT_NE(task, nullptr);
+  EXPECT_EQ(task->explainRefusal(kName),
+            (root / "etc/a.plist").string() +
+                " came nearest, but its Unit is other.service, and the caller runs in "
+                "caller.service");
+  accounts.whenAskedForIds = [&](const std::string&) {
+    fs::remove(root / "proc/7/exe");
+    fs::create_symlink("/bin/sh", root / "proc/7/exe");
+  };
+  EXPECT_EQ(task->explainRefusal(kName), "the caller has ended, or has become another program");
+  EXPECT_EQ(files.explainNoTask(token), "the caller cannot be examined now") << "there is nothing in its way";
+}
+
+TEST_F(ExplanationTest, WhatCannotBeReadNowIsTheReason) {
+  const auto file = grant("etc/a.plist");
+  const Child caller(program);
+  auto files = makeFiles();
+  const auto task = files.makeTask(caller.token());
+  ASSERT_NE(task, nullptr);
+  {
+    const FailingCall failing("read", EIO, 0);
+    EXPECT_EQ(task->explainRefusal(kName), file.string() + " cannot be examined now");
+  }
+  EXPECT_EQ(task->explainRefusal(kName), file.string() + " gives it by now");
+  EXPECT_THAT(log.entries(), IsEmpty());
+}
+
 TEST_F(ExplanationTest, ACallerThatHasEndedIsToldAsSuch) {
   grant("etc/a.plist");
   auto files = makeFiles();
