@@ -84,20 +84,20 @@ bool EntitlementCheck::HasEntitlement(std::string_view name, const AuditToken& c
   const LogContext context{described, LogScope::current().routine};
   const LogScope scope(context);
   const SecurityTask::Answer answer = task != nullptr ? task->copyEntitlement(name) : SecurityTask::Answer{};
+  const bool isGranted = !answer.error && answer.value.asBoolean() == true;
   try {
-    if (answer.error || answer.value.asBoolean() != true) {
-      const auto why = [&] {
+    if (isGranted) {
+      remember(name, caller, described);
+    } else if (described != nullptr) {
+      refusals_.refused(*described, std::string(name).c_str(), [&] {
         return task != nullptr ? task->explainRefusal(name) : security_.explainNoTask(caller);
-      };
-      if (described != nullptr) refusals_.refused(*described, std::string(name).c_str(), why);
-      return false;
+      });
     }
-    remember(name, caller, described);
-    return true;
   } catch (...) {
-    // Out of memory: refused without a line; or granted all the same, and the next question is asked afresh.
-    return !answer.error && answer.value.asBoolean() == true;
+    // Out of memory: refused without a line, or granted all the same; the next question is asked afresh.
+    state_->evict(pid);
   }
+  return isGranted;
 }
 
 std::shared_ptr<const LogCaller> EntitlementCheck::describe(const AuditToken& caller) const noexcept {
@@ -125,24 +125,14 @@ void EntitlementCheck::remember(std::string_view name, const AuditToken& caller,
                                              },
                                              {});
     }
-    const auto grant =
-        grants.emplace(pid, Grant{std::string(name), caller.pidVersion(), std::move(described)});
-    try {
-      if (source != nullptr) watchers.insert_or_assign(pid, source);
-    } catch (...) {
-      grants.erase(grant);
-      throw;
-    }
+    if (source != nullptr) watchers.insert_or_assign(pid, source);
+    grants.emplace(pid, Grant{std::string(name), caller.pidVersion(), std::move(described)});
   }
   if (source == nullptr) return;
   // Without the lock: a process that has exited by now is told of at once, and where the telling cannot be
   // posted it happens within this very call. Evicted or torn down meanwhile, the source is cancelled, and
   // this does nothing.
-  try {
-    source->activate();
-  } catch (...) {
-    state_->evict(pid);  // nobody would tell of its exit
-  }
+  source->activate();
 }
 
 void EntitlementCheck::tearDown() noexcept {

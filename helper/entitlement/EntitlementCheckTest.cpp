@@ -424,6 +424,19 @@ TEST_F(EntitlementCheckTest, AGrantedCallerIsDescribedUntilItsProcessExitsAndNob
   EXPECT_TRUE(log.entries().empty());
 }
 
+TEST_F(EntitlementCheckTest, WithoutMemoryToDescribeACallerTheAnswerIsTheSame) {
+  RecordingLog log;
+  security.hasNoMemoryToDescribe = true;
+  security.addProcess(tokenOf(8));
+  EXPECT_FALSE(check.HasEntitlement(kName, tokenOf(8)));
+  security.grant(caller, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(check.HasEntitlement(kName, caller));
+  EXPECT_EQ(check.describe(caller), nullptr);
+  EXPECT_TRUE(log.entries().empty());
+  check.tearDown();
+  EXPECT_EQ(check.describe(caller), nullptr);
+}
+
 TEST_F(EntitlementCheckTest, TwoChecksKnowNothingOfEachOther) {
   EntitlementCheck another(security, queues);
   security.grant(caller, kName, PropertyList::boolean(true));

@@ -2,71 +2,88 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "helper/entitlement/RefusalLog.h"
 
+#include <algorithm>
+#include <string_view>
+
 #include "platform/log/Log.h"
 
 namespace brenvik {
 namespace {
 
-const char* orElse(const std::string& text, const char* otherwise) noexcept {
-  return text.empty() ? otherwise : text.c_str();
+constexpr std::size_t kKept = 255;  // of an executable's path
+
+const char* orElse(const char* text, const char* otherwise) noexcept {
+  return *text == '\0' ? otherwise : text;
 }
 
 }  // namespace
 
 void RefusalLog::refused(const LogCaller& caller, const char* entitlement,
                          const std::function<std::string()>& why) {
-  const auto untold = count(caller);
-  if (!untold) return;
-  if (untold->count > 0) {
-    untold->isOfOthers ? tellOfOthers(untold->count) : tell({caller.uid, caller.executable}, untold->count);
-  }
+  if (!count(caller)) return;
   // A caller chooses its path, and must not push the reason out of the line; the field has all of it.
   logUnified(LogLevel::standard,
              "refused process %d: account %u, executable %.256s, unit %.256s: it does not hold %s: %s",
-             static_cast<int>(caller.pid), caller.uid, orElse(caller.executable, "not known"),
-             orElse(caller.unit, "none"), entitlement, orElse(why(), "not known"));
+             static_cast<int>(caller.pid), caller.uid, orElse(caller.executable.c_str(), "not known"),
+             orElse(caller.unit.c_str(), "none"), entitlement, orElse(why().c_str(), "not known"));
 }
 
-std::optional<RefusalLog::Untold> RefusalLog::count(const LogCaller& caller) {
+bool RefusalLog::count(const LogCaller& caller) {
   const std::lock_guard lock(mutex_);
   const auto now = now_();
-  const Key key{caller.uid, caller.executable};
-  auto known = callers_.find(key);
-  if (known == callers_.end() && callers_.size() >= kMostCallers) dropThoseWithNothingToTell(now);
-  Account* account = nullptr;
-  if (known != callers_.end()) {
-    account = &known->second;
-  } else if (callers_.size() < kMostCallers) {
-    callers_.emplace(key, Account{now, 0});
-    return Untold{};
-  } else if (others_) {
-    account = &*others_;
-  } else {
-    others_ = Account{now, 0};
-    return Untold{};
+  if (Account* const known = find(caller)) {
+    if (now - known->told < kInterval) {
+      ++known->untold;
+      return false;
+    }
+    if (known->untold > 0) tell(*known);
+    known->told = now;
+    known->untold = 0;
+    return true;
   }
-  if (now - account->told < kInterval) {
-    ++account->untold;
-    return std::nullopt;
+  if (count_ == callers_.size()) dropThoseOfLongAgo(now);
+  if (count_ < callers_.size()) {
+    Account& account = callers_[count_++];
+    account.uid = caller.uid;
+    account.executable[caller.executable.copy(account.executable.data(), kKept)] = '\0';
+    account.told = now;
+    account.untold = 0;
+    return true;
   }
-  account->told = now;
-  return Untold{std::exchange(account->untold, 0), known == callers_.end()};
+  if (others_ && now - others_->told < kInterval) {
+    ++others_->untold;
+    return false;
+  }
+  if (others_ && others_->untold > 0) tellOfOthers(others_->untold);
+  others_ = Others{now, 0};
+  return true;
 }
 
-void RefusalLog::dropThoseWithNothingToTell(std::chrono::nanoseconds now) noexcept {
-  for (auto it = callers_.begin(); it != callers_.end();) {
-    if (now - it->second.told < kInterval) {
-      ++it;
+RefusalLog::Account* RefusalLog::find(const LogCaller& caller) noexcept {
+  const auto beginning = std::string_view(caller.executable).substr(0, kKept);
+  const auto end = callers_.begin() + static_cast<std::ptrdiff_t>(count_);
+  const auto found = std::find_if(callers_.begin(), end, [&](const Account& each) {
+    return each.uid == caller.uid && each.executable.data() == beginning;
+  });
+  return found == end ? nullptr : &*found;
+}
+
+void RefusalLog::dropThoseOfLongAgo(std::chrono::nanoseconds now) noexcept {
+  for (std::size_t i = 0; i < count_;) {
+    Account& each = callers_[i];
+    if (now - each.told < kInterval) {
+      ++i;
       continue;
     }
-    if (it->second.untold > 0) tell(it->first, it->second.untold);
-    it = callers_.erase(it);
+    if (each.untold > 0) tell(each);
+    each = callers_[--count_];
   }
 }
 
-void RefusalLog::tell(const Key& who, std::uint64_t untold) noexcept {
+void RefusalLog::tell(const Account& account) noexcept {
   logUnified(LogLevel::standard, "refused %llu more check-ins of account %u, executable %.256s",
-             static_cast<unsigned long long>(untold), who.first, orElse(who.second, "not known"));
+             static_cast<unsigned long long>(account.untold), account.uid,
+             orElse(account.executable.data(), "not known"));
 }
 
 void RefusalLog::tellOfOthers(std::uint64_t untold) noexcept {
@@ -76,11 +93,11 @@ void RefusalLog::tellOfOthers(std::uint64_t untold) noexcept {
 
 void RefusalLog::flush() noexcept {
   const std::lock_guard lock(mutex_);
-  for (const auto& [who, account] : callers_) {
-    if (account.untold > 0) tell(who, account.untold);
+  for (std::size_t i = 0; i < count_; ++i) {
+    if (callers_[i].untold > 0) tell(callers_[i]);
   }
   if (others_ && others_->untold > 0) tellOfOthers(others_->untold);
-  callers_.clear();
+  count_ = 0;
   others_.reset();
 }
 

@@ -4,10 +4,11 @@
 
 #include <sys/types.h>
 
+#include <array>
 #include <chrono>
+#include <cstddef>
 #include <cstdint>
 #include <functional>
-#include <map>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -36,25 +37,30 @@ class RefusalLog {
   void flush() noexcept;
 
  private:
-  using Key = std::pair<uid_t, std::string>;
+  // Without initialisers and without allocations: what is never used costs nothing, and a lack of memory
+  // leaves no traces.
   struct Account {
+    uid_t uid;
+    std::array<char, 256> executable;  // its beginning, with a NUL
+    std::chrono::nanoseconds told;
+    std::uint64_t untold;
+  };
+  struct Others {
     std::chrono::nanoseconds told{};
     std::uint64_t untold = 0;
   };
-  struct Untold {
-    std::uint64_t count = 0;
-    bool isOfOthers = false;
-  };
-  // Counts the refusal. When it is to be written: how many were not since the last that was.
-  std::optional<Untold> count(const LogCaller& caller);
-  void dropThoseWithNothingToTell(std::chrono::nanoseconds now) noexcept;
-  static void tell(const Key& who, std::uint64_t untold) noexcept;
+  // Counts the refusal, and says whether it is to be written.
+  bool count(const LogCaller& caller);
+  Account* find(const LogCaller& caller) noexcept;
+  void dropThoseOfLongAgo(std::chrono::nanoseconds now) noexcept;
+  static void tell(const Account& account) noexcept;
   static void tellOfOthers(std::uint64_t untold) noexcept;
 
   const Clock now_;
   std::mutex mutex_;
-  std::map<Key, Account> callers_;
-  std::optional<Account> others_;
+  std::size_t count_ = 0;
+  std::array<Account, kMostCallers> callers_;
+  std::optional<Others> others_;
 };
 
 }  // namespace brenvik

@@ -115,6 +115,22 @@ TEST_F(RefusalLogTest, ManyCallersAreRememberedOnlyUpToALimitAndTheOthersCountAs
                                               " more check-ins of further callers")));
 }
 
+TEST_F(RefusalLogTest, NumbersOfThoseThatAreForgottenAndOfAllOthersAreToldInTime) {
+  const auto stranger = [](std::size_t i) { return LogCaller{7, static_cast<uid_t>(i), "/x", ""}; };
+  for (std::size_t i = 0; i < RefusalLog::kMostCallers; ++i) refuse(stranger(i));
+  refuse(stranger(0));
+  for (std::size_t i = 0; i < 4; ++i) refuse(stranger(2000 + i));
+  now += seconds(60);
+  for (std::size_t i = 1; i < RefusalLog::kMostCallers; ++i) refuse(stranger(i));
+  log.clear();
+  refuse(stranger(1000));  // takes the place of the only one of long ago
+  EXPECT_EQ(log.entries().front(), line("refused 1 more check-ins of account 0, executable /x"));
+  log.clear();
+  refuse(stranger(3000));
+  ASSERT_EQ(log.entries().size(), 2U);
+  EXPECT_EQ(log.entries().front(), line("refused 3 more check-ins of further callers"));
+}
+
 TEST_F(RefusalLogTest, APathAsLongAsTheSystemAllowsLeavesRoomForTheReason) {
   refuse({7, 501, "/" + std::string(4094, 'x'), ""});
   ASSERT_EQ(log.entries().size(), 1U);

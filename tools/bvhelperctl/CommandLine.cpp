@@ -83,7 +83,8 @@ std::string entitlementAdvice() {
                                 ? "This program must belong to root first, and be writable by nobody else.\n"
                                 : "";
   return owner +
-         "Give it one: put the following into a file " BRENVIK_ENTITLEMENT_DIRECTORY
+         "bvhelperctl access shows why, step by step. Give it one: put the following into a "
+         "file " BRENVIK_ENTITLEMENT_DIRECTORY
          "/bvhelperctl.plist, owned by root and writable by nobody else:\n"
          "  <?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
          "  <plist version=\"1.0\"><dict>\n"
@@ -95,8 +96,7 @@ std::string entitlementAdvice() {
          "</string>\n"
          "    <key>Entitlements</key>\n"
          "    <dict><key>com.norvale.Teravox.BrenvikHelper.allow</key><true/></dict>\n"
-         "  </dict></plist>\n"
-         "bvhelperctl access shows what the entitlement files say now, step by step.";
+         "  </dict></plist>";
 }
 
 // What to do when the account may not even connect.

@@ -5,6 +5,7 @@
 #include <functional>
 #include <map>
 #include <mutex>
+#include <new>
 #include <string>
 #include <utility>
 
@@ -58,6 +59,7 @@ class FakeTaskSecurity final : public TaskSecurity {
 
   // What every process is and why it is refused, to be set before.
   SecurityTask::Caller described{"/usr/libexec/program", "program.service"};
+  bool hasNoMemoryToDescribe = false;
   std::string refusal = "no file names it";
   std::function<void()> whileAsked;  // runs within each question, no lock held
 
@@ -83,7 +85,10 @@ class FakeTaskSecurity final : public TaskSecurity {
       ++owner_.explanations_;
       return owner_.refusal;
     }
-    Caller describeCaller() const override { return owner_.described; }
+    Caller describeCaller() const override {
+      if (owner_.hasNoMemoryToDescribe) throw std::bad_alloc();
+      return owner_.described;
+    }
 
    private:
     FakeTaskSecurity& owner_;

@@ -74,7 +74,7 @@ std::unique_ptr<SecurityTask> EntitlementFiles::makeTask(const AuditToken& calle
 
 std::string EntitlementFiles::explainNoTask(const AuditToken& caller) noexcept try {
   const auto process = CallerProcess::pin(proc_, caller.pid(), caller.pidVersion());
-  if (!process || !process->executable()) return "the caller has ended";
+  if (!process) return "the caller has ended";
   if (!process->userNamespace()) return "the caller's user namespace cannot be told";
   return isInOurNamespace(*process) ? "the caller cannot be examined now"
                                     : "the caller is in a user namespace of its own";

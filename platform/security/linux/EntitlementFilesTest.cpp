@@ -39,6 +39,10 @@ extern "C" ssize_t read(int fd, void* bytes, std::size_t size) {
 extern "C" ssize_t getdents64(int fd, void* bytes, std::size_t size) noexcept {
   return brenvik::FailingCall::failsNow("getdents64") ? -1 : ::syscall(SYS_getdents64, fd, bytes, size);
 }
+extern "C" int lstat(const char* path, struct stat* facts) noexcept {
+  if (brenvik::FailingCall::failsNow("lstat")) return -1;
+  return static_cast<int>(::syscall(SYS_newfstatat, AT_FDCWD, path, facts, AT_SYMLINK_NOFOLLOW));
+}
 extern "C" int openat(int directory, const char* path, int flags, ...) {
   if (brenvik::FailingCall::failsNow("openat")) return -1;
   return static_cast<int>(::syscall(SYS_openat, directory, path, flags, 0));
@@ -913,7 +917,7 @@ TEST_F(EntitlementFilesTest, OutOfDescriptorsTheQuestionCannotBeAnsweredAndALate
 
   limitTo(next);  // not even the directory
   auto answer = task->copyEntitlement(kName);
-  limitTo(next + 2);  // the directory and the walk to it, but not the file
+  limitTo(next + 1);  // the directory, but not the file
   const auto second = task->copyEntitlement(kName);
   limitTo(next);
   const auto noTask = files.makeTask(caller.token());
@@ -949,17 +953,17 @@ TEST_F(EntitlementFilesTest, WhatTheSystemCannotSayNowIsNoNoAndNoLaterFileAnswer
   const Child caller(program);
   const auto task = files.makeTask(caller.token());
   ASSERT_NE(task, nullptr);
-  const auto depth = [](const fs::path& path) {
-    return static_cast<int>(std::distance(path.begin(), path.end())) - 1;
+  // Of the walk to a path, the top included.
+  const auto looks = [](const fs::path& path) {
+    return static_cast<int>(std::distance(path.begin(), path.end()));
   };
-  const int directory = depth(root / "etc");  // openings of the walk to it, and then of itself
-  const int executable = directory + 2 + depth(program);
-  for (const Case& which :
-       {Case{"getdents64", EIO, 0, "etc"}, Case{"openat", EMFILE, 0, "etc"},
-        Case{"openat", ENOMEM, directory, "etc"}, Case{"openat", EMFILE, directory + 1, "etc/a.plist"},
-        Case{"read", EIO, 0, "etc/a.plist"}, Case{"openat", EIO, directory + 2, "etc/a.plist"},
-        Case{"openat", ENOMEM, executable - 1, "etc/a.plist"},
-        Case{"openat", EMFILE, executable, "etc/a.plist"}, Case{"read", EIO, 1, "etc/a.plist"}}) {
+  const int directory = looks(root / "etc");
+  const int executable = directory + looks(program);
+  for (const Case& which : {Case{"lstat", EMFILE, 0, "etc"}, Case{"lstat", ENOMEM, directory - 1, "etc"},
+                            Case{"getdents64", EIO, 0, "etc"}, Case{"openat", EMFILE, 0, "etc/a.plist"},
+                            Case{"read", EIO, 0, "etc/a.plist"}, Case{"lstat", EIO, directory, "etc/a.plist"},
+                            Case{"lstat", ENOMEM, executable - 1, "etc/a.plist"},
+                            Case{"openat", EMFILE, 1, "etc/a.plist"}, Case{"read", EIO, 1, "etc/a.plist"}}) {
     const FailingCall failing(which.call, which.error, which.skipped);
     const auto answer = task->copyEntitlement(kName);
     EXPECT_TRUE(answer.error) << which.call << which.skipped;
@@ -1103,6 +1107,40 @@ TEST_F(ExplanationTest, AFileThatIsPassedOverIsNamedWithWhatIsWrong) {
   EXPECT_EQ(explain(caller.token()),
             file.string() + " is passed over: not owned by root, or others may write to it");
   EXPECT_THAT(log.entries(), IsEmpty()) << "a search that explains logs nothing";
+}
+
+TEST_F(MadeUpProcessTest, ACallerThatBecomesAnotherProgramWhileItIsExplainedIsToldAsSuch) {
+  for (const char* const name : {"etc/a.plist", "etc/b.plist"}) {
+    grant(name, "<true/>", quoted("User", "keeper") + quoted("Unit", "other.service"));
+  }
+  accounts.accounts["keeper"] = {AccountIds{0, 0}, std::nullopt};
+  auto files = makeFiles((root / "proc").string());
+  const auto task = files.makeTask(token);
+  ASSERT_NE(task, nullptr);
+  EXPECT_EQ(task->explainRefusal(kName),
+            (root / "etc/a.plist").string() +
+                " came nearest, but its Unit is other.service, and the caller runs in "
+                "caller.service");
+  accounts.whenAskedForIds = [&](const std::string&) {
+    fs::remove(root / "proc/7/exe");
+    fs::create_symlink("/bin/sh", root / "proc/7/exe");
+  };
+  EXPECT_EQ(task->explainRefusal(kName), "the caller has ended, or has become another program");
+  EXPECT_EQ(files.explainNoTask(token), "the caller cannot be examined now") << "there is nothing in its way";
+}
+
+TEST_F(ExplanationTest, WhatCannotBeReadNowIsTheReason) {
+  const auto file = grant("etc/a.plist");
+  const Child caller(program);
+  auto files = makeFiles();
+  const auto task = files.makeTask(caller.token());
+  ASSERT_NE(task, nullptr);
+  {
+    const FailingCall failing("read", EIO, 0);
+    EXPECT_EQ(task->explainRefusal(kName), file.string() + " cannot be examined now");
+  }
+  EXPECT_EQ(task->explainRefusal(kName), file.string() + " gives it by now");
+  EXPECT_THAT(log.entries(), IsEmpty());
 }
 
 TEST_F(ExplanationTest, ACallerThatHasEndedIsToldAsSuch) {

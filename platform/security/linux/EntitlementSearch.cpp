@@ -191,7 +191,7 @@ class EntitlementSearch::Run {
     }
     if (!S_ISDIR(walked.facts.st_mode)) return passOverDirectory("not a directory");
     if (!isRootsAlone(walked.facts)) return passOverDirectory(kChangeable);
-    const UniqueFd folder(::openat(walked.fd.get(), ".", O_RDONLY | O_DIRECTORY | O_NONBLOCK | O_CLOEXEC));
+    const UniqueFd folder(::open(walked.place.c_str(), O_RDONLY | O_DIRECTORY | O_NONBLOCK | O_CLOEXEC));
     if (!folder.isValid()) return giveUp();
     const auto names = entitlementFilesIn(folder.get());
     if (!names) return giveUp();

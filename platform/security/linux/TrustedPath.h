@@ -6,8 +6,6 @@
 
 #include <string>
 
-#include "platform/base/UniqueFd.h"
-
 namespace brenvik {
 
 // Where a path leads, and whether only root can change that: every folder on the way and every link that is
@@ -15,15 +13,14 @@ namespace brenvik {
 // bit may, because nobody can rename root's entries there.
 struct TrustedPath {
   enum class Outcome {
-    trusted,    // `fd` is what stands there; its own owner and mode are for the caller to judge
+    trusted,    // `facts` are of what stands at `place`; its own owner and mode are for the caller to judge
     untrusted,  // somebody else than root can change what stands at `place`
     missing,    // nothing can be reached there: `error` says why
     unknown,    // it cannot be found out now: `error` says why
   };
   Outcome outcome = Outcome::unknown;
-  UniqueFd fd;             // O_PATH
-  struct stat facts = {};  // of fd
-  std::string place;       // untrusted: the folder or link at fault
+  struct stat facts = {};
+  std::string place;  // without links; of what is untrusted: the folder or link at fault
   int error = 0;
 };
 
