@@ -88,10 +88,11 @@ TEST(PropertyListTextTest, KeepsTheOrderAndTheTypesInJson) {
   EXPECT_EQ(
       jsonLine(jsonOf(example())),
       R"({"Name":"Norvale\nMobil\u001b[31m","Version":-7,"Huge":18446744073709551615,"Ratio":0.25,"On":true,)"
-      R"("When":"2000-12-31T23:59:59.500Z","Icon":{"base64":"Zm9vYg=="},"Empty":{},"None":[],)"
+      R"("When":{"date":"2000-12-31T23:59:59.500Z"},"Icon":{"base64":"Zm9vYg=="},"Empty":{},"None":[],)"
       R"("List":["a",{"k":"v"}]})");
   EXPECT_EQ(jsonLine(jsonOf(PropertyList())), "null");
-  EXPECT_EQ(jsonLine(jsonOf(PropertyList::real(std::numeric_limits<double>::infinity()))), "\"inf\"");
+  EXPECT_EQ(jsonLine(jsonOf(PropertyList::real(std::numeric_limits<double>::infinity()))),
+            R"({"real":"inf"})");
 }
 
 TEST(PropertyListTextTest, NothingOnATerminalCanSteerIt) {
