@@ -513,8 +513,9 @@ Parameter bytes(const char* name, const char* help, std::size_t limit) {
   return {name, help, ValueKind::bytes, limit};
 }
 
-std::vector<Command> makeTable() {
-  return {
+// The rows are built in place: a start must not pay for copies of them.
+std::span<const Command> makeTable() {
+  static const Command rows[] = {
       {"", "ping", "check in and leave again", {"BVMobileHelperCheckIn"}, {}, {}, ping},
 
       {"prefs",
@@ -754,6 +755,7 @@ std::vector<Command> makeTable() {
        nullptr,
        true},
   };
+  return rows;
 }
 
 }  // namespace
@@ -797,10 +799,7 @@ const std::vector<Group>& commandGroups() {
   return groups;
 }
 
-const std::vector<Command>& commandTable() {
-  static const std::vector<Command> table = makeTable();
-  return table;
-}
+std::span<const Command> commandTable() { return makeTable(); }
 
 std::string wordsOf(const Command& command) {
   return wordsOf(CommandSyntax{command.group, command.name, command.summary, nullptr, nullptr});

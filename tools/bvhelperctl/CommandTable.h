@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <nlohmann/json.hpp>
 #include <optional>
+#include <span>
 #include <string>
 #include <vector>
 
@@ -53,7 +54,7 @@ struct Command {
 // What may stand anywhere on the command line.
 const std::vector<Parameter>& globalOptions();
 const std::vector<Group>& commandGroups();
-const std::vector<Command>& commandTable();
+std::span<const Command> commandTable();
 
 // "prefs set"
 std::string wordsOf(const Command& command);
