@@ -15,7 +15,10 @@ import subprocess
 import sys
 import tempfile
 import zipfile
+from unittest import mock
 
+import network
+import test_lasd
 import wire
 from harness import ALLOW, BUILD, ENTITLEMENTS, LOG_ERR, LOG_NOTICE, Daemon, HelperTest, entitle, eventually, main
 
@@ -384,6 +387,64 @@ class Waiting(ToolTest):
         done = run("watch", "--json", "--timeout", "0.05", "--count", "2", "--directory", str(self.folder))
         self.assertEqual((done.returncode, schema.check(json.loads(done.stdout), ["watch"])),
                          (6, {"ok": False, "error": "0 of 2 arrived in time"}))
+
+
+class WaitingForDatabases(test_lasd.UpdateTest, ToolTest):
+    """A real update server; the tool itself listens for the outcome."""
+
+    def prepare(self):
+        ToolTest.prepare(self)
+        with mock.patch.object(network, "MessagePort"):
+            super().prepare()
+
+    def test_each_database_is_told_when_it_is_done(self):
+        manifest = self.serve({"gsm": "1.0", "lte": "2.0"})
+        size = len(self.content("gsm", "1.0"))
+        self.expect(f"gsm: updated, version 1.0, {size} bytes\numts: no update required\n", "lasd", "check", "--wait",
+                    "--type", "umts", "--type", "gsm")
+        answer = self.json("lasd", "check", "--wait", "--mask", "12")
+        self.assertEqual((answer["mask"], answer["databases"]), (12, [
+            {"type": "gsm", "outcome": "no update required", "version": "1.0", "bytes": size},
+            {"type": "lte", "outcome": "updated", "version": "2.0", "bytes": size}]))
+        self.assert_installed(manifest)
+
+    def test_the_one_that_failed_is_named(self):
+        self.serve({"gsm": "1.0", "lte": "2.0"}, gsm=f"https://{test_lasd.HOST}/none.gz")
+        answer = self.json("lasd", "check", "--wait", "--mask", "12", status=1)
+        self.assertEqual([(each["type"], each["outcome"]) for each in answer["databases"]],
+                         [("gsm", "failed"), ("lte", "updated")])
+        self.assertEqual(answer["error"], "1 of 2 checks failed; the helper's log tells why")
+
+    def test_a_check_without_an_outcome_is_given_up(self):
+        self.serve({"gsm": "1.0", "lte": "2.0"}, gsm="")  # such a check ends without a notification
+        self.expect("bvhelperctl: gsm: the helper took the request, and told no answer in time\n--timeout waits longer. The "
+                    "helper's log may tell why.\n", "--timeout", "1.5", "lasd", "check", "--wait", "--mask", "12", status=6)
+
+
+class Completion(ToolTest):
+    def test_domains_and_keys_that_exist(self):
+        # A blank or a quote would not be one plain word to a shell.
+        for key in ("Version", "Name", "with blank"):
+            self.assertEqual(run("prefs", "set", "com.norvale.completion", key, "v").returncode, 0)
+        self.addCleanup(pathlib.Path("/root/Library/Preferences/com.norvale.completion.plist").unlink)
+        self.assertIn("com.norvale.completion\n", run("__complete", "domains").stdout)
+        self.expect("Name\nVersion\n", "__complete", "keys", "com.norvale.completion")
+        self.expect("", "__complete", "keys", "none")
+        self.expect("", "__complete", "keys", "../../etc/passwd")
+        self.assertEqual(run("__complete", "keys", "com.norvale.completion", account="stranger").stdout, "")
+
+
+class ManualPage(ToolTest):
+    def test_every_example_runs(self):
+        page = BUILD / "docs" / "man" / "bvhelperctl.1.scd"
+        if not page.exists():
+            self.skipTest("the manual pages are not built")
+        examples = re.findall(r"^```\n(.*?)^```$", page.read_text(), flags=re.S | re.M)
+        self.assertGreaterEqual(len(examples), 6)
+        for example in examples:
+            done = subprocess.run(["bash", "-euo", "pipefail", "-c", example], capture_output=True, timeout=60,
+                                  env={**os.environ, "PATH": f"{TOOL.parent}:{os.environ['PATH']}"})
+            self.assertEqual(done.returncode, 0, (example, done.stdout, done.stderr))
 
 
 class Terminal(ToolTest):
