@@ -10,6 +10,7 @@ import pathlib
 import plistlib
 import re
 import shutil
+import socket
 import sqlite3
 import subprocess
 import sys
@@ -20,7 +21,7 @@ from unittest import mock
 import network
 import test_lasd
 import wire
-from harness import ALLOW, BUILD, ENTITLEMENTS, LOG_ERR, LOG_NOTICE, Daemon, HelperTest, entitle, eventually, main
+from harness import ALLOW, BUILD, DAEMON, ENTITLEMENTS, LOG_ERR, LOG_NOTICE, Daemon, HelperTest, entitle, eventually, main
 
 sys.path.append(str(pathlib.Path(__file__).parents[2] / "tools" / "tests"))
 import schema  # noqa: E402, of another folder
@@ -159,6 +160,40 @@ class Switches(ToolTest):
         self.expect("radio manager logs on\nbvhelperctl: note: there is no system bus: no radio manager was told\n",
                     "radio-logs", "on")
         self.logs.wait_for("bsd", LOG_ERR, "Enabling wireless radio manager logs: 1")
+
+
+    def test_a_helper_that_may_not_send_is_told_of(self):
+        self.daemon.stop()
+        helper = subprocess.Popen(["setpriv", "--bounding-set", "-net_raw", DAEMON], stdin=subprocess.DEVNULL)
+        self.addCleanup(helper.wait)
+        self.addCleanup(helper.kill)
+        eventually(lambda: run("ping").returncode == 0, what="the helper")
+        note = ("the helper may not send echoes: it lacks CAP_NET_RAW, and net.ipv4.ping_group_range leaves its groups out")
+        self.assertIn(note, self.json("heartbeat", "on")["notes"])
+        pathlib.Path("/proc/sys/net/ipv4/ping_group_range").write_text("0 0")  # the helper's group
+        self.addCleanup(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").write_text, "1 0")
+        self.assertNotIn(note, self.json("heartbeat", "on")["notes"])
+
+    def test_a_bus_without_a_radio_manager_is_told_of(self):
+        pathlib.Path("/run/dbus").mkdir(exist_ok=True)
+        self.addCleanup(shutil.rmtree, "/run/dbus")
+        bus = subprocess.Popen(["dbus-daemon", "--session", "--nofork", "--nosyslog", "--print-address=1",
+                                "--address=unix:path=/run/dbus/system_bus_socket"], stdout=subprocess.PIPE)
+        with bus.stdout:
+            self.addCleanup(bus.wait)
+            self.addCleanup(bus.kill)
+            bus.stdout.readline()
+            self.assertEqual(self.json("radio-logs", "on")["notes"], ["ModemManager is not running: no radio manager was told"])
+            self.assertNotIn("notes", self.json("radio-logs", "off"))
+
+    def test_a_silent_bus_does_not_keep_the_user_waiting(self):
+        pathlib.Path("/run/dbus").mkdir(exist_ok=True)
+        self.addCleanup(shutil.rmtree, "/run/dbus")
+        with socket.socket(socket.AF_UNIX, socket.SOCK_STREAM) as bus:
+            bus.bind("/run/dbus/system_bus_socket")
+            bus.listen(4)
+            self.assertEqual(self.json("radio-logs", "on")["notes"],
+                             ["the system bus does not answer: no radio manager may have been told"])
 
 
 class Labels(ToolTest):
