@@ -95,6 +95,26 @@ TEST(PropertyListTextTest, KeepsTheOrderAndTheTypesInJson) {
             R"({"real":"inf"})");
 }
 
+TEST(PropertyListTextTest, WhatJsonHasNotIsTakenForNothingElse) {
+  const auto shown = [](const PropertyList& value) { return jsonLine(jsonOf(value)); };
+  EXPECT_EQ(shown(PropertyList::string("nan")), "\"nan\"");
+  EXPECT_EQ(shown(PropertyList::real(std::numeric_limits<double>::quiet_NaN())), R"({"real":"nan"})");
+  EXPECT_EQ(shown(PropertyList::real(1)), "1.0");
+  EXPECT_EQ(shown(PropertyList::date(1e300)), R"({"secondsSince2001":"1e+300"})");
+  EXPECT_EQ(shown(PropertyList::date(253402300800.0 - 978307200.0 - 1)),
+            R"({"date":"9999-12-31T23:59:59Z"})");
+  for (const char* key : {"base64", "date", "secondsSince2001", "real", "dictionary"}) {
+    const std::string plain = "{\"" + std::string(key) + "\":\"x\"}";
+    EXPECT_EQ(shown(PropertyList::dictionary({{key, PropertyList::string("x")}})),
+              "{\"dictionary\":" + plain + "}");
+  }
+  EXPECT_EQ(
+      shown(PropertyList::dictionary({{"date", PropertyList::string("x")}, {"k", PropertyList::integer(1)}})),
+      R"({"date":"x","k":1})");
+  EXPECT_EQ(jsonLine(jsonOfText("K\xC3\xB6ln")), "\"K\xC3\xB6ln\"");
+  EXPECT_EQ(jsonLine(jsonOfText("\xFF")), R"({"base64":"/w=="})");
+}
+
 TEST(PropertyListTextTest, NothingOnATerminalCanSteerIt) {
   EXPECT_EQ(printable("\x1B]0;title\x07\x7F\t"), "\\x1b]0;title\\x07\\x7f\\t");
   EXPECT_EQ(printable("\xC2\x9B\x33m K\xC3\xB6ln"), "\\xc2\\x9b3m K\xC3\xB6ln");
