@@ -15,6 +15,7 @@ import sqlite3
 import subprocess
 import sys
 import tempfile
+import unittest
 import zipfile
 from unittest import mock
 
@@ -480,6 +481,20 @@ class ManualPage(ToolTest):
             done = subprocess.run(["bash", "-euo", "pipefail", "-c", example], capture_output=True, timeout=60,
                                   env={**os.environ, "PATH": f"{TOOL.parent}:{os.environ['PATH']}"})
             self.assertEqual(done.returncode, 0, (example, done.stdout, done.stderr))
+
+
+class Demo(unittest.TestCase):
+    def test_commands_are_printed_so_that_they_can_be_pasted(self):
+        tour = pathlib.Path(__file__).with_name("demo-tour").read_text()
+        function = re.search(r"^quoted\(\) \{\n.*?^\}\n", tour, flags=re.S | re.M)[0]
+        words = ["plain", "", "two words", "it's", '"', "$HOME", "`x`", "a\nb", "\\", "*", "~", "#", "K\u00f6ln", "--x=1", "%M\\n"]
+        printed = subprocess.run(["bash", "-c", function + 'quoted "$@"', "bash", *words], capture_output=True, text=True,
+                                 check=True, timeout=60).stdout
+        self.assertTrue(printed.startswith("plain '' 'two words' "))
+        for shell in ("bash", "sh"):
+            pasted = subprocess.run([shell, "-c", f"printf '%s\\0' {printed}"], capture_output=True, text=True, check=True,
+                                    timeout=60).stdout
+            self.assertEqual(pasted.split("\0")[:-1], words)
 
 
 class Terminal(ToolTest):
