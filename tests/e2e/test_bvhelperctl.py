@@ -477,6 +477,9 @@ class ManualPage(ToolTest):
             self.skipTest("the manual pages are not built")
         examples = re.findall(r"^```\n(.*?)^```$", page.read_text(), flags=re.S | re.M)
         self.assertGreaterEqual(len(examples), 6)
+        self.addCleanup(pathlib.Path("/root/Library/Preferences/com.example.greeting.plist").unlink)
+        # Before the helper is stopped, which is a clean-up as well.
+        self.addCleanup(run, "voicemail", "reset")
         for example in examples:
             done = subprocess.run(["bash", "-euo", "pipefail", "-c", example], capture_output=True, timeout=60,
                                   env={**os.environ, "PATH": f"{TOOL.parent}:{os.environ['PATH']}"})
