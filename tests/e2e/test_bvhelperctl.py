@@ -282,6 +282,10 @@ class Carrier(ToolTest):
 
 
 class Voicemail(ToolTest):
+    def prepare(self):
+        super().prepare()
+        pathlib.Path("/var/mobile/Library").mkdir(parents=True, exist_ok=True)
+
     def test_tokens(self):
         self.expect("(no token)\n", "voicemail", "token", status=3)
         self.expect("set the voicemail token\n", "voicemail", "set-token", "general")
