@@ -368,9 +368,10 @@ void manualOfOptions(const ProgramSyntax& program) {
   }
 }
 
-void manualOfExitStatuses() {
+void manualOfExitStatuses(bool asksHelper) {
   print("# EXIT STATUS\n\n");
   for (const ExitStatusFacts& each : kExitStatuses) {
+    if (each.isOfRequest && !asksHelper) continue;
     print("*" + std::to_string(static_cast<int>(each.status)) + "*\n\t" + scd(each.meaning) + "\n\n");
   }
 }
@@ -400,7 +401,7 @@ int main(int argc, char** argv) {
     } else {
       manual();
     }
-    manualOfExitStatuses();
+    manualOfExitStatuses(program.asksHelper);
   } else {
     return 2;
   }

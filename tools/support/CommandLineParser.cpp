@@ -357,7 +357,7 @@ std::string helpText(const ProgramSyntax& program, const ParsedLine& line) {
   if (!line.command) text += helpOfCommands(program, line.group);
   text += '\n';
   if (!isWholeProgram && !isOnlyCommand) text += globalOptionsHint(program);
-  return text + exitStatusLine() + '\n';
+  return text + exitStatusLine(program.asksHelper) + '\n';
 }
 
 }  // namespace brenvik::tools

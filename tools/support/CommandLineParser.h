@@ -33,6 +33,7 @@ struct ProgramSyntax {
   const std::vector<Group>* groups;
   std::vector<CommandSyntax> commands;
   const std::vector<Parameter>* globalOptions;  // may stand anywhere; "--help" and "--version" among them
+  bool asksHelper = true;
 };
 
 struct ParsedLine {

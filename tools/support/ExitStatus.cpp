@@ -33,9 +33,10 @@ ExitStatus statusOfCode(std::int32_t code) noexcept {
   }
 }
 
-std::string exitStatusLine() {
+std::string exitStatusLine(bool asksHelper) {
   std::string line = "Exit status:";
   for (const ExitStatusFacts& each : kExitStatuses) {
+    if (each.isOfRequest && !asksHelper) continue;
     line += (each.status == ExitStatus::done ? " " : "; ") + std::to_string(static_cast<int>(each.status)) +
             " " + each.name;
   }

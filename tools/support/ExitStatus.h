@@ -33,8 +33,9 @@ enum class ExitStatus : std::uint8_t {
 
 struct ExitStatusFacts {
   ExitStatus status;
-  const char* name;     // a word or two, for the last line of the help
-  const char* meaning;  // a sentence or more, for the manual page
+  const char* name;          // a word or two, for the last line of the help
+  const char* meaning;       // a sentence or more, for the manual page
+  bool isOfRequest = false;  // only a program that asks the helper can end so
 };
 
 inline constexpr std::array kExitStatuses{
@@ -47,17 +48,20 @@ inline constexpr std::array kExitStatuses{
     ExitStatusFacts{
         ExitStatus::noValue, "no such value",
         "The helper was asked, and there is no such value: no preference, no token, no country, no "
-        "address."},
+        "address.",
+        true},
     ExitStatusFacts{ExitStatus::refused, "refused",
                     "Refused: this program lacks the entitlement or may not connect, or the helper does not "
-                    "touch that path."},
+                    "touch that path.",
+                    true},
     ExitStatusFacts{ExitStatus::unreachable, "no helper",
-                    "There is no helper, or it left before it took the request. Nothing was done."},
+                    "There is no helper, or it left before it took the request. Nothing was done.", true},
     ExitStatusFacts{ExitStatus::timedOut, "no answer in time",
                     "No answer in time. What was asked may still be carried out."},
     ExitStatusFacts{ExitStatus::protocol, "protocol broken",
                     "The helper and this program do not understand each other, or the helper left without an "
-                    "answer to what may have been carried out."},
+                    "answer to what may have been carried out.",
+                    true},
     ExitStatusFacts{ExitStatus::outputLost, "output lost",
                     "Done, but not everything could be written to standard output."},
 };
@@ -65,7 +69,7 @@ inline constexpr std::array kExitStatuses{
 // How a program ends after this code of the client library.
 ExitStatus statusOfCode(std::int32_t code) noexcept;
 
-// "Exit status: 0 done; 1 failed; ..."
-std::string exitStatusLine();
+// "Exit status: 0 done; 1 failed; ...", of a program that asks the helper or of one that does not.
+std::string exitStatusLine(bool asksHelper);
 
 }  // namespace brenvik::tools

@@ -38,7 +38,7 @@ ProgramSyntax standInSyntax() {
   };
   constexpr const char* kSummary =
       "Stands in for the telephony daemon: prints the helper's pushes and notifications, and answers.";
-  return {kStandInName, kSummary, &noGroups, {{"", "", kSummary, &none, &none}}, &options};
+  return {kStandInName, kSummary, &noGroups, {{"", "", kSummary, &none, &none}}, &options, false};
 }
 
 }  // namespace brenvik::tools
