@@ -3,7 +3,7 @@
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 """Makes the parts of manual pages that come from somewhere else, and the journal's catalogue.
 
-usage: pages.py fill PAGE.scd COMMANDS      the page with its marks replaced; COMMANDS: output of `command-pages man`
+usage: pages.py fill PAGE.scd COMMANDS      the page with its marks replaced; COMMANDS: output of `command-pages man PROGRAM`
        pages.py catalogue                   entries for journalctl -x
        pages.py functions                   names of the C library's functions, one a line
 

@@ -1,6 +1,7 @@
 # SPDX-License-Identifier: Apache-2.0
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 """bvhelperctl, and through it the C library, against the real daemon."""
+import contextlib
 import datetime
 import errno
 import json
@@ -8,22 +9,34 @@ import os
 import pathlib
 import plistlib
 import pwd
+import re
 import shutil
+import socket
+import sqlite3
 import subprocess
+import sys
 import tempfile
+import unittest
 import zipfile
+from unittest import mock
 
+import network
+import test_lasd
 import wire
-from harness import ALLOW, BUILD, ENTITLEMENTS, LOG_ERR, LOG_NOTICE, Daemon, HelperTest, entitle, eventually, main
+from harness import ALLOW, BUILD, DAEMON, ENTITLEMENTS, LOG_ERR, LOG_NOTICE, Daemon, HelperTest, entitle, eventually, main
+
+sys.path.append(str(pathlib.Path(__file__).parents[2] / "tools" / "tests"))
+import schema  # noqa: E402, of another folder
 
 # Where every account may run it, which the build folder need not be.
 TOOL = pathlib.Path("/run/bin/bvhelperctl")
 OWN_FILE = ENTITLEMENTS / "bvhelperctl.plist"
 
 
-def run(*arguments, account=None):
-    return subprocess.run([TOOL, *arguments], capture_output=True, text=True, timeout=60, stdin=subprocess.DEVNULL,
-                          user=account, group=account, extra_groups=os.getgrouplist(account, pwd.getpwnam(account).pw_gid) if account else None)
+def run(*arguments, account=None, given="", **more):
+    groups = os.getgrouplist(account, pwd.getpwnam(account).pw_gid) if account else None
+    return subprocess.run([TOOL, *arguments], capture_output=True, text=True, timeout=60, input=given,
+                           user=account, group=account, extra_groups=groups, **more)
 
 
 class ToolTest(HelperTest):
@@ -46,7 +59,7 @@ class ToolTest(HelperTest):
     def json(self, *arguments, status=0):
         done = run("--json", *arguments)
         self.assertEqual((done.returncode, done.stderr), (status, ""), arguments)
-        return json.loads(done.stdout)
+        return schema.check(json.loads(done.stdout), arguments)
 
 
 class Admission(ToolTest):
@@ -56,7 +69,7 @@ class Admission(ToolTest):
     def test_what_a_refused_tool_advises_admits_it(self):
         OWN_FILE.unlink()
         refused = run("ping")
-        self.assertEqual((refused.returncode, refused.stdout), (1, ""))
+        self.assertEqual((refused.returncode, refused.stdout), (4, ""))
         lines = refused.stderr.splitlines()
         self.assertEqual(lines[0], f"bvhelperctl: refused: the caller lacks the entitlement {ALLOW}")
         self.assertIn(str(OWN_FILE), lines[1])
@@ -66,7 +79,7 @@ class Admission(ToolTest):
 
     def test_an_account_that_may_not_connect_is_told_about_the_group(self):
         refused = run("ping", account="outsider")
-        self.assertEqual((refused.returncode, refused.stdout), (1, ""))
+        self.assertEqual((refused.returncode, refused.stdout), (4, ""))
         lines = refused.stderr.splitlines()
         self.assertEqual(lines[0], "bvhelperctl: refused: this account may not connect to /run/brenvik/bootstrap/"
                                    "com.norvale.brenvik.mobile-helper")
@@ -74,13 +87,13 @@ class Admission(ToolTest):
 
     def test_the_advice_names_the_account_of_the_caller(self):
         refused = run("ping", account="telephony")
-        self.assertEqual(refused.returncode, 1)
+        self.assertEqual(refused.returncode, 4)
         advice = "\n".join(line.removeprefix("  ") for line in refused.stderr.splitlines()[2:])
         self.assertEqual(plistlib.loads(advice.encode())["User"], "telephony")
         (ENTITLEMENTS / "60-telephony.plist").write_text(advice)
         self.addCleanup((ENTITLEMENTS / "60-telephony.plist").unlink)
         self.assertEqual(run("ping", account="telephony").returncode, 0)
-        self.assertEqual(run("ping", account="stranger").returncode, 1)
+        self.assertEqual(run("ping", account="stranger").returncode, 4)
 
 
 class Preferences(ToolTest):
@@ -97,11 +110,22 @@ class Preferences(ToolTest):
         with wire.Client() as client:  # an independent reader sees the last one
             self.assertEqual(plistlib.loads(client.copy_preference(self.DOMAIN, "Key")), "")
 
+    def test_any_bytes_come_back_and_do_not_spoil_the_domain(self):
+        content = self.folder / "content"
+        content.write_bytes(bytes(range(256)) + b"\n")
+        self.expect(f"set Any of {self.DOMAIN}\n", "prefs", "set", self.DOMAIN, "Any", "--type", "bytes", f"@{content}")
+        raw = subprocess.run([TOOL, "prefs", "get", "--raw", self.DOMAIN, "Any"], capture_output=True, timeout=60)
+        self.assertEqual((raw.returncode, raw.stdout), (0, content.read_bytes()))
+        refused = run("prefs", "set", self.DOMAIN, "Control", "-", given="a\x01b")
+        self.assertEqual((refused.returncode, refused.stdout), (2, ""))
+        file = f"/root/Library/Preferences/{self.DOMAIN}.plist"
+        self.assertIn("Any", self.json("plist", "load", file)["value"])
+
     def test_a_deleted_value_is_gone(self):
         self.expect(f"set Key of {self.DOMAIN}\n", "prefs", "set", self.DOMAIN, "Key", "v")
         self.expect(f"removed Key of {self.DOMAIN}\n", "prefs", "delete", self.DOMAIN, "Key")
-        self.expect("(no value)\n", "prefs", "get", self.DOMAIN, "Key")
-        self.assertIs(self.json("prefs", "get", self.DOMAIN, "Key")["found"], False)
+        self.expect("(no value)\n", "prefs", "get", self.DOMAIN, "Key", status=3)
+        self.assertIs(self.json("prefs", "get", self.DOMAIN, "Key", status=3)["found"], False)
 
     def test_a_value_larger_than_a_datagram_goes_and_comes_in_memory(self):
         value = {"Text": "x" * 100_000, "List": list(range(20_000))}
@@ -127,7 +151,7 @@ class Files(ToolTest):
         self.expect("Name: Norvale\nWhen: 2024-02-29T12:30:00Z\nList:\n  - 1\n  -\n    k: <1 byte: 76>\n", "plist", "load",
                     str(file))
         self.assertEqual(self.json("plist", "load", str(file))["value"],
-                         {"Name": "Norvale", "When": "2024-02-29T12:30:00Z", "List": [1, {"k": {"base64": "dg=="}}]})
+                         {"Name": "Norvale", "When": {"date": "2024-02-29T12:30:00Z"}, "List": [1, {"k": {"base64": "dg=="}}]})
 
     def test_a_file_that_is_none_is_explained(self):
         missing = f"{self.folder}/none"
@@ -137,12 +161,50 @@ class Files(ToolTest):
 
 class Switches(ToolTest):
     def test_heartbeat(self):
-        self.expect("cellular heartbeat on\n", "heartbeat", "on")
+        self.expect("cellular heartbeat on\nbvhelperctl: note: there is no interface pdp_ip0: the echoes take the default "
+                    "route\n", "heartbeat", "on")
+        self.assertEqual(self.json("heartbeat", "on")["notes"],
+                         ["there is no interface pdp_ip0: the echoes take the default route"])
         self.expect("cellular heartbeat off\n", "heartbeat", "off")
 
     def test_radio_logs(self):
-        self.expect("radio manager logs on\n", "radio-logs", "on")
+        self.expect("radio manager logs on\nbvhelperctl: note: there is no system bus: no radio manager was told\n",
+                    "radio-logs", "on")
         self.logs.wait_for("bsd", LOG_ERR, "Enabling wireless radio manager logs: 1")
+
+
+    def test_a_helper_that_may_not_send_is_told_of(self):
+        self.daemon.stop()
+        helper = subprocess.Popen(["setpriv", "--bounding-set", "-net_raw", DAEMON], stdin=subprocess.DEVNULL)
+        self.addCleanup(helper.wait)
+        self.addCleanup(helper.kill)
+        eventually(lambda: run("ping").returncode == 0, what="the helper")
+        note = ("the helper may not send echoes: it lacks CAP_NET_RAW, and net.ipv4.ping_group_range leaves its groups out")
+        self.assertIn(note, self.json("heartbeat", "on")["notes"])
+        pathlib.Path("/proc/sys/net/ipv4/ping_group_range").write_text("0 0")  # the helper's group
+        self.addCleanup(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").write_text, "1 0")
+        self.assertNotIn(note, self.json("heartbeat", "on")["notes"])
+
+    def test_a_bus_without_a_radio_manager_is_told_of(self):
+        pathlib.Path("/run/dbus").mkdir(exist_ok=True)
+        self.addCleanup(shutil.rmtree, "/run/dbus")
+        bus = subprocess.Popen(["dbus-daemon", "--session", "--nofork", "--nosyslog", "--print-address=1",
+                                "--address=unix:path=/run/dbus/system_bus_socket"], stdout=subprocess.PIPE)
+        with bus.stdout:
+            self.addCleanup(bus.wait)
+            self.addCleanup(bus.kill)
+            bus.stdout.readline()
+            self.assertEqual(self.json("radio-logs", "on")["notes"], ["ModemManager is not running: no radio manager was told"])
+            self.assertNotIn("notes", self.json("radio-logs", "off"))
+
+    def test_a_silent_bus_does_not_keep_the_user_waiting(self):
+        pathlib.Path("/run/dbus").mkdir(exist_ok=True)
+        self.addCleanup(shutil.rmtree, "/run/dbus")
+        with socket.socket(socket.AF_UNIX, socket.SOCK_STREAM) as bus:
+            bus.bind("/run/dbus/system_bus_socket")
+            bus.listen(4)
+            self.assertEqual(self.json("radio-logs", "on")["notes"],
+                             ["the system bus does not answer: no radio manager may have been told"])
 
 
 class Labels(ToolTest):
@@ -158,8 +220,21 @@ class Labels(ToolTest):
 
 
 class Contacts(ToolTest):
+    STORE = pathlib.Path("/var/mobile/Library/AddressBook/contacts.db")
+
     def test_without_a_contacts_store_the_remap_counts_as_done(self):
-        self.expect("moved contacts from old to new\n", "contacts", "remap", "old", "new")
+        self.expect("no contacts to move: there is no contacts store\n", "contacts", "remap", "old", "new")
+        self.assertIs(self.json("contacts", "remap", "old", "new")["store"], False)
+
+    def test_with_a_store_the_contacts_are_moved(self):
+        self.STORE.parent.mkdir(parents=True, exist_ok=True)
+        self.addCleanup(shutil.rmtree, self.STORE.parent)
+        with contextlib.closing(sqlite3.connect(self.STORE)) as contacts:
+            contacts.execute("CREATE TABLE contact_channels(contact_id INTEGER NOT NULL, channel_identifier TEXT NOT NULL)")
+            contacts.execute("INSERT INTO contact_channels VALUES(1, 'old')")
+            contacts.commit()
+            self.expect("remapped contacts from old to new\n", "contacts", "remap", "old", "new")
+            self.assertEqual(contacts.execute("SELECT * FROM contact_channels").fetchall(), [(1, "new")])
 
 
 class Carrier(ToolTest):
@@ -179,7 +254,7 @@ class Carrier(ToolTest):
         self.assertFalse(link.is_symlink())
         other = self.folder / "other"
         self.expect(f"bvhelperctl: refused: {other} is not one of the carrier links and files that may be replaced, or "
-                    "is a folder\n", "carrier", "replace-link", "t", str(other), status=1)
+                    "is a folder\n", "carrier", "replace-link", "t", str(other), status=4)
         self.assertFalse(other.is_symlink())
         self.expect(f"{other} -> t\n", "carrier", "create-link", "t", str(other))
         self.assertEqual(other.readlink(), pathlib.Path("t"))
@@ -187,7 +262,7 @@ class Carrier(ToolTest):
         self.expect(f"bvhelperctl: {nowhere} cannot be made: its folder is missing, or may not be written by the helper "
                     "(code 5)\n", "carrier", "create-link", "t", str(nowhere), status=1)
         self.expect(f"bvhelperctl: refused: {other} is no carrier file: not listed, not in the carrier bundles, no "
-                    "package in /tmp\n", "carrier", "remove", str(other), status=1)
+                    "package in /tmp\n", "carrier", "remove", str(other), status=4)
 
     def test_archives_and_crash_logs(self):
         archive = self.folder / "a.zip"
@@ -217,17 +292,21 @@ class Carrier(ToolTest):
 
 
 class Voicemail(ToolTest):
+    def prepare(self):
+        super().prepare()
+        pathlib.Path("/var/mobile/Library").mkdir(parents=True, exist_ok=True)
+
     def test_tokens(self):
-        self.expect("(no token)\n", "voicemail", "token")
+        self.expect("(no token)\n", "voicemail", "token", status=3)
         self.expect("set the voicemail token\n", "voicemail", "set-token", "general")
         self.expect("set the voicemail token for K\n", "voicemail", "set-token", "--key", "K", "special")
         self.expect("general\n", "voicemail", "token")
         self.expect("special\n", "voicemail", "token", "--key", "K")
         self.expect("cleared the voicemail token\n", "voicemail", "clear")
-        self.expect("(no token)\n", "voicemail", "token")
+        self.expect("(no token)\n", "voicemail", "token", status=3)
         self.expect("special\n", "voicemail", "token", "--key", "K")
         self.expect("cleared the voicemail token and removed every record\n", "voicemail", "reset")
-        self.expect("(no token)\n", "voicemail", "token", "--key", "K")
+        self.expect("(no token)\n", "voicemail", "token", "--key", "K", status=3)
         self.expect("not subscribed\n", "voicemail", "subscribed")
 
 
@@ -299,20 +378,184 @@ class Events(ToolTest):
         self.assertEqual((event["event"], event["values"]["Address"]), ("local-address", ""))
 
 
+class Waiting(ToolTest):
+    """The tool takes the telephony daemon's place, asks, and shows the answer."""
+
+    COUNTRY = pathlib.Path("/var/lib/brenvik/country.plist")
+    ADVICE = ("--wait takes the telephony daemon's place: it must not run, and only root may listen there. Nothing was "
+              "asked.\n")
+
+    def prepare(self):
+        super().prepare()
+        self.COUNTRY.parent.mkdir(parents=True, exist_ok=True)
+        self.COUNTRY.write_bytes(plistlib.dumps({"CountryCode": "DE"}))
+        self.addCleanup(lambda: self.COUNTRY.unlink(missing_ok=True))
+
+    def test_a_civic_address(self):
+        self.expect("CountryCode: DE\n", "location", "civic", "--wait", "0", "0")
+        self.assertEqual(self.json("location", "civic", "--wait", "0", "0")["values"], {
+            "Client": ["BrenvikMobileHelper"], "CountryCode": "DE", "State": "", "City": "", "PostalCode": ""})
+        self.logs.wait_for("bsd", LOG_NOTICE, "sendCivicInfoToQV sent civic info to Brenvik successfully")
+
+    def test_nothing_known_is_no_value(self):
+        self.COUNTRY.unlink()
+        self.expect("(not known)\n", "location", "civic", "--wait", "0", "0", status=3)
+
+    def test_an_address_that_cannot_be_had_is_a_failure_that_names_the_log(self):
+        self.expect("bvhelperctl: the public address could not be found; the helper's log tells why\n", "location", "wan-ip",
+                    "--wait", status=1)
+
+    def test_nobody_is_asked_while_somebody_else_listens(self):
+        with subprocess.Popen([BUILD / "brenvik-standin"], stdout=subprocess.PIPE, stderr=subprocess.PIPE,
+                              text=True) as standin:
+            standin.stderr.readline()
+            for arguments in (["location", "civic", "0", "0"], ["location", "wan-ip"], ["lasd", "check"]):
+                self.expect("bvhelperctl: cannot listen in /run/brenvik/bootstrap: another process serves that name\n"
+                            + self.ADVICE, *arguments, "--wait", status=1)
+            self.assertEqual(self.json("location", "wan-ip", "--wait", status=1)["advice"] + "\n", self.ADVICE)
+            standin.terminate()
+            self.assertEqual(standin.stdout.read(), "")
+
+    def test_an_update_check_that_fails(self):
+        self.expect("gsm: failed\nlte: failed\nbvhelperctl: 2 of 2 checks failed; the helper's log tells why\n", "lasd",
+                    "check", "--wait", "--type", "lte", "--type", "gsm", status=1)
+        answer = self.json("lasd", "check", "--wait", "--mask", "2", status=1)
+        self.assertEqual(answer["databases"], [{"type": "cdma", "outcome": "failed"}])
+
+    def test_an_answer_that_does_not_come_is_given_up(self):
+        # The tool listens where the helper does not report.
+        self.expect("bvhelperctl: the helper took the request, and told no answer in time\n--timeout waits longer. The "
+                    "helper's log may tell why.\n", "location", "civic", "--wait", "--timeout", "0.2", "--directory",
+                    str(self.folder), "0", "0", status=6)
+        self.assertEqual(list(self.folder.iterdir()), [])
+
+    def test_watch_ends_in_time(self):
+        done = run("watch", "--timeout", "0.05", "--directory", str(self.folder))
+        self.assertEqual((done.returncode, done.stdout), (0, ""))
+        done = run("watch", "--timeout", "0.05", "--count", "2", "--directory", str(self.folder))
+        self.assertEqual((done.returncode, done.stderr.splitlines()[1]), (6, "bvhelperctl: 0 of 2 arrived in time"))
+        done = run("watch", "--json", "--timeout", "0.05", "--count", "2", "--directory", str(self.folder))
+        self.assertEqual((done.returncode, schema.check(json.loads(done.stdout), ["watch"])),
+                         (6, {"ok": False, "error": "0 of 2 arrived in time"}))
+
+
+class WaitingForDatabases(test_lasd.UpdateTest, ToolTest):
+    """A real update server; the tool itself listens for the outcome."""
+
+    def prepare(self):
+        ToolTest.prepare(self)
+        with mock.patch.object(network, "MessagePort"):
+            super().prepare()
+
+    def test_each_database_is_told_when_it_is_done(self):
+        manifest = self.serve({"gsm": "1.0", "lte": "2.0"})
+        size = len(self.content("gsm", "1.0"))
+        self.expect(f"gsm: updated, version 1.0, {size} bytes\numts: no update required\n", "lasd", "check", "--wait",
+                    "--type", "umts", "--type", "gsm")
+        answer = self.json("lasd", "check", "--wait", "--mask", "12")
+        self.assertEqual((answer["mask"], answer["databases"]), (12, [
+            {"type": "gsm", "outcome": "no update required", "version": "1.0", "bytes": size},
+            {"type": "lte", "outcome": "updated", "version": "2.0", "bytes": size}]))
+        self.assert_installed(manifest)
+
+    def test_the_one_that_failed_is_named(self):
+        self.serve({"gsm": "1.0", "lte": "2.0"}, gsm=f"https://{test_lasd.HOST}/none.gz")
+        answer = self.json("lasd", "check", "--wait", "--mask", "12", status=1)
+        self.assertEqual([(each["type"], each["outcome"]) for each in answer["databases"]],
+                         [("gsm", "failed"), ("lte", "updated")])
+        self.assertEqual(answer["error"], "1 of 2 checks failed; the helper's log tells why")
+
+    def test_a_check_without_an_outcome_is_given_up(self):
+        self.serve({"gsm": "1.0", "lte": "2.0"}, gsm="")  # such a check ends without a notification
+        self.expect("bvhelperctl: gsm: the helper took the request, and told no answer in time\n--timeout waits longer. The "
+                    "helper's log may tell why.\n", "--timeout", "1.5", "lasd", "check", "--wait", "--mask", "12", status=6)
+
+
+class Completion(ToolTest):
+    def test_domains_and_keys_that_exist(self):
+        # A blank or a quote would not be one plain word to a shell.
+        for key in ("Version", "Name", "with blank"):
+            self.assertEqual(run("prefs", "set", "com.norvale.completion", key, "v").returncode, 0)
+        self.addCleanup(pathlib.Path("/root/Library/Preferences/com.norvale.completion.plist").unlink)
+        self.assertIn("com.norvale.completion\n", run("__complete", "domains").stdout)
+        self.expect("Name\nVersion\n", "__complete", "keys", "com.norvale.completion")
+        self.expect("", "__complete", "keys", "none")
+        self.expect("", "__complete", "keys", "../../etc/passwd")
+        self.assertEqual(run("__complete", "keys", "com.norvale.completion", account="stranger").stdout, "")
+
+
+class ManualPage(ToolTest):
+    def test_every_example_runs(self):
+        page = BUILD / "docs" / "man" / "bvhelperctl.1.scd"
+        if not page.exists():
+            self.skipTest("the manual pages are not built")
+        examples = re.findall(r"^```\n(.*?)^```$", page.read_text(), flags=re.S | re.M)
+        self.assertGreaterEqual(len(examples), 6)
+        self.addCleanup(pathlib.Path("/root/Library/Preferences/com.example.greeting.plist").unlink)
+        # Before the helper is stopped, which is a clean-up as well.
+        self.addCleanup(run, "voicemail", "reset")
+        for example in examples:
+            done = subprocess.run(["bash", "-euo", "pipefail", "-c", example], capture_output=True, timeout=60,
+                                  env={**os.environ, "PATH": f"{TOOL.parent}:{os.environ['PATH']}"})
+            self.assertEqual(done.returncode, 0, (example, done.stdout, done.stderr))
+
+
+class Demo(unittest.TestCase):
+    def test_commands_are_printed_so_that_they_can_be_pasted(self):
+        tour = pathlib.Path(__file__).with_name("demo-tour").read_text()
+        function = re.search(r"^quoted\(\) \{\n.*?^\}\n", tour, flags=re.S | re.M)[0]
+        words = ["plain", "", "two words", "it's", '"', "$HOME", "`x`", "a\nb", "\\", "*", "~", "#", "K\u00f6ln", "--x=1", "%M\\n"]
+        printed = subprocess.run(["bash", "-c", function + 'quoted "$@"', "bash", *words], capture_output=True, text=True,
+                                 check=True, timeout=60).stdout
+        self.assertTrue(printed.startswith("plain '' 'two words' "))
+        for shell in ("bash", "sh"):
+            pasted = subprocess.run([shell, "-c", f"printf '%s\\0' {printed}"], capture_output=True, text=True, check=True,
+                                    timeout=60).stdout
+            self.assertEqual(pasted.split("\0")[:-1], words)
+
+
+class Terminal(ToolTest):
+    """A terminal is tried as a terminal."""
+
+    def test_progress_and_colours(self):
+        subprocess.run(["tmux", "-L", "bvhelperctl", "new-session", "-d", "-x", "100", "-y", "20",
+                        "TERM=xterm exec /bin/sh"], check=True, timeout=60, env={**os.environ, "NO_COLOR": ""})
+        self.addCleanup(subprocess.run, ["tmux", "-L", "bvhelperctl", "kill-server"], timeout=60, check=False)
+
+        def tmux(*arguments):
+            return subprocess.run(["tmux", "-L", "bvhelperctl", *arguments], check=True, timeout=60, capture_output=True,
+                                  text=True).stdout
+
+        def shown(*commands):
+            tmux("send-keys", "clear; " + "; ".join(commands) + "; echo the-end", "Enter")
+            eventually(lambda: re.search("^the-end$", tmux("capture-pane", "-p"), re.M), what="the commands' end")
+            return tmux("capture-pane", "-p"), tmux("capture-pane", "-p", "-e")
+
+        plain, coloured = shown(f"{TOOL} frobnicate", f"{TOOL} lasd check --wait --type gsm")
+        self.assertIn('bvhelperctl: unknown command "frobnicate"', plain)
+        self.assertRegex(coloured, "\x1b\\[(1;)?31m.*bvhelperctl:")
+        # Nothing is left of the line of progress.
+        self.assertIn("\ngsm: failed\nbvhelperctl: 1 of 1 checks failed", plain)
+        self.assertNotIn("checking", plain)
+        plain, coloured = shown("export NO_COLOR=1", f"{TOOL} frobnicate")
+        self.assertIn('bvhelperctl: unknown command "frobnicate"', plain)
+        self.assertNotIn("\x1b[", coloured)
+
+
 class Life(ToolTest):
-    def test_no_daemon_is_told_with_status_2(self):
+    def test_no_daemon_is_told_with_a_status_of_its_own(self):
         self.daemon.stop()
         done = run("ping")
-        self.assertEqual(done.returncode, 2)
+        self.assertEqual(done.returncode, 5)
         self.assertIn("cannot reach the helper at /run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper", done.stderr)
 
     def test_many_short_lives_leave_nothing_in_the_daemon(self):
         # The first leaves what is made once: the areas, and the queue on which exits are handled.
-        self.assertEqual(run("prefs", "get", "d", "k").returncode, 0)
+        self.assertEqual(run("prefs", "get", "d", "k").returncode, 3)  # nothing is there
         eventually(lambda: "global" in self.daemon.threads(), what="its exit being handled")
         before = self.daemon.descriptors()
         for _ in range(30):
-            self.assertEqual(run("prefs", "get", "d", "k").returncode, 0)
+            self.assertEqual(run("prefs", "get", "d", "k").returncode, 3)  # nothing is there
         eventually(lambda: self.daemon.descriptors() <= before, what="the descriptors back where they were")
 
 

@@ -313,7 +313,7 @@ def passes_its_own_smoke_test():
 
 def refused_without_an_entitlement():
     done = bvhelperctl("ping", check=False)
-    expect_equal(done.returncode, 1, "ping without an entitlement")
+    expect_equal(done.returncode, 4, "ping without an entitlement")
     expect("com.norvale.Teravox.BrenvikHelper.allow" in done.stderr, "says how to get one")
 
 
@@ -374,7 +374,7 @@ def works_for_the_whole_phone():
 
     bvhelperctl("voicemail", "set-token", "--key", "a-key", "another-token")
     bvhelperctl("voicemail", "clear")
-    expect_equal(bvhelperctl("voicemail", "token").stdout, "(no token)\n")
+    expect_equal(bvhelperctl("voicemail", "token", check=False).stdout, "(no token)\n")
     expect_equal(bvhelperctl("voicemail", "token", "--key", "a-key").stdout, "another-token\n")
     bvhelperctl("voicemail", "reset")
     expect_equal(bvhelperctl("voicemail", "subscribed").stdout, "not subscribed\n")
@@ -400,16 +400,19 @@ def works_for_the_whole_phone():
     with socket.socket(socket.AF_UNIX, socket.SOCK_STREAM) as bus:
         bus.settimeout(10)
         bus.bind("/run/dbus/system_bus_socket")
-        bus.listen(1)
-        bvhelperctl("radio-logs", "on")
-        with bus.accept()[0] as connection:
-            connection.settimeout(10)
-            expect(connection.recv(64).startswith(b"\0AUTH"), "somebody speaks to the bus")
-            # A queue for "utility" work, which the unit lets lower its own priority.
-            tasks = pathlib.Path(f"/proc/{property_of(SERVICE, 'MainPID')}/task").iterdir()
-            niceness = [int((task / "stat").read_text().rpartition(")")[2].split()[16]) for task in tasks
-                        if (task / "comm").read_text() == "RadioManagerLog\n"]
-            expect_equal(niceness, [10])
+        bus.listen(4)
+        expect("the system bus does not answer" in bvhelperctl("radio-logs", "on").stderr, "says that nobody was told")
+        helper, callers = int(property_of(SERVICE, "MainPID")), []
+        while helper not in callers:  # bvhelperctl asks the bus as well
+            with bus.accept()[0] as connection:
+                connection.settimeout(10)
+                callers.append(struct.unpack("iII", connection.getsockopt(socket.SOL_SOCKET, socket.SO_PEERCRED, 12))[0])
+                expect(connection.recv(64).startswith(b"\0AUTH"), "whoever connects speaks to the bus")
+        # A queue for "utility" work, which the unit lets lower its own priority.
+        tasks = pathlib.Path(f"/proc/{helper}/task").iterdir()
+        niceness = [int((task / "stat").read_text().rpartition(")")[2].split()[16]) for task in tasks
+                    if (task / "comm").read_text() == "RadioManagerLog\n"]
+        expect_equal(niceness, [10])
     os.unlink("/run/dbus/system_bus_socket")
 
 
@@ -546,11 +549,11 @@ def other_accounts_are_told_apart():
     """Reading the executable of another account's process is what CAP_SYS_PTRACE is kept for."""
     run("useradd", "--system", "--no-create-home", "telephony")
     done = run("setpriv", "--reuid=telephony", "--regid=telephony", "--init-groups", "bvhelperctl", "ping", check=False)
-    expect_equal(done.returncode, 1, "an account that is not in the group")
+    expect_equal(done.returncode, 4, "an account that is not in the group")
     expect("usermod -aG brenvik telephony" in done.stderr, "what to do about it")
     run("usermod", "-aG", "brenvik", "telephony")
     done = run("setpriv", "--reuid=telephony", "--regid=telephony", "--init-groups", "bvhelperctl", "ping", check=False)
-    expect_equal(done.returncode, 1, "another account, the same program")
+    expect_equal(done.returncode, 4, "another account, the same program")
     file = pathlib.Path("/etc/brenvik/entitlements.d/60-telephony.plist")
     file.write_bytes(plistlib.dumps({"Executable": "/usr/bin/bvhelperctl", "User": "telephony",
                                      "Entitlements": {"com.norvale.Teravox.BrenvikHelper.allow": True}}))
@@ -758,7 +761,7 @@ def remove():
             if pathlib.Path(each).read_text() == "BrenvikMobileHe\n":
                 running.append(each)
     expect_equal(running, [], "none is left running")
-    expect_equal(bvhelperctl("ping", check=False).returncode, 2, "no helper")
+    expect_equal(bvhelperctl("ping", check=False).returncode, 5, "no helper")
     expect(os.path.exists("/etc/brenvik/entitlements.d/50-bvhelperctl.plist"), "entitlements stay")
 
 

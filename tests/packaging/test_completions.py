@@ -35,7 +35,16 @@ class Offers:
         cls.addClassCleanup(folder.cleanup)
         cls.folder = pathlib.Path(folder.name)
         (cls.folder / "some.plist").touch()
-        (cls.folder / "bvhelperctl").symlink_to(BUILD / "bvhelperctl")
+        # A shell asks the program for domains and keys; what exists is this test's.
+        program = cls.folder / "bvhelperctl"
+        program.write_text("""#!/bin/sh
+            case "$*" in
+              "__complete domains") printf '%s\\n' com.norvale.carrier com.norvale.lasd ;;
+              "__complete keys com.norvale.carrier") printf '%s\\n' Name Version ;;
+            esac
+            """)
+        program.chmod(0o755)
+        cls.environment = {**os.environ, "HOME": str(cls.folder), "PATH": f"{cls.folder}:{os.environ['PATH']}"}
 
     def test_first_word(self):
         self.assertEqual(self.offered("bvhelperctl "), words_of_help())
@@ -51,7 +60,7 @@ class Offers:
         self.assertEqual(self.offered("bvhelperctl --json --timeout 5 plist "), {"load"})
 
     def test_options(self):
-        self.assertEqual(self.offered("bvhelperctl prefs set --"), GLOBAL | {"--type"})
+        self.assertEqual(self.offered("bvhelperctl prefs set --"), GLOBAL | {"--type", "--literal"})
         self.assertEqual(self.offered("bvhelperctl ping --"), GLOBAL)
 
     def test_choices(self):
@@ -66,6 +75,22 @@ class Offers:
         self.assertEqual(self.offered("bvhelperctl carrier create-link so"), set())
         self.assertEqual(self.offered("bvhelperctl carrier create-link x so"), {"some.plist"})
 
+    def test_labels(self):
+        self.assertEqual(self.offered("bvhelperctl labels badges --label p"), {"primary", "personal"})
+        self.assertEqual(self.offered("bvhelperctl labels localized --label USER_LABEL_P"),
+                         {"USER_LABEL_PRIMARY", "USER_LABEL_PERSONAL"})
+
+    def test_domains_and_keys_that_exist(self):
+        self.assertEqual(self.offered("bvhelperctl prefs get com.norvale.c"), {"com.norvale.carrier"})
+        self.assertEqual(self.offered("bvhelperctl --json prefs set com.norvale.carrier "), {"Name", "Version"})
+        self.assertEqual(self.offered("bvhelperctl prefs delete com.norvale.none "), set())
+
+    def test_the_stand_in(self):
+        self.assertEqual(self.offered("brenvik-standin --"), {
+            "--json", "--count", "--timeout", "--refuse", "--hang", "--directory", "--helper-uid", "--version", "--help"})
+        self.assertEqual(self.offered("brenvik-standin --directory so"), {"some.plist"})
+        self.assertEqual(self.offered("brenvik-standin "), set())
+
     def test_nothing_after_the_last(self):
         self.assertEqual(self.offered("bvhelperctl ping "), set())
 
@@ -73,24 +98,24 @@ class Offers:
 @unittest.skipUnless(shutil.which("bash"), "bash is not installed")
 class Bash(Offers, unittest.TestCase):
     SCRIPT = """source "$1"; read -ra COMP_WORDS <<< "$2"; [[ $2 == *' ' ]] && COMP_WORDS+=('')
-        COMP_CWORD=$(( ${#COMP_WORDS[@]} - 1 )); _bvhelperctl
+        COMP_CWORD=$(( ${#COMP_WORDS[@]} - 1 )); name=${COMP_WORDS[0]}; "_${name//-/_}"
         (( ${#COMPREPLY[@]} )) && printf '%s\\n' "${COMPREPLY[@]}"; true"""
 
     def offered(self, line):
-        return set(run("bash", "--norc", "-c", self.SCRIPT, "bash", str(COMPLETIONS / "bash"), line,
-                       cwd=self.folder).split())
+        return set(run("bash", "--norc", "-c", self.SCRIPT, "bash", str(COMPLETIONS / "bash" / line.split()[0]), line,
+                       cwd=self.folder, env=self.environment).split())
 
     def test_it_is_registered(self):
-        shown = run("bash", "--norc", "-c", 'source "$1"; complete -p bvhelperctl', "bash", str(COMPLETIONS / "bash"))
-        self.assertIn("-F _bvhelperctl bvhelperctl", shown)
+        for name, function in (("bvhelperctl", "_bvhelperctl"), ("brenvik-standin", "_brenvik_standin")):
+            shown = run("bash", "--norc", "-c", 'source "$1"; complete -p "$2"', "bash", str(COMPLETIONS / "bash" / name), name)
+            self.assertIn(f"-F {function} {name}", shown)
 
 
 @unittest.skipUnless(shutil.which("fish"), "fish is not installed")
 class Fish(Offers, unittest.TestCase):
     def offered(self, line):
-        environment = {**os.environ, "HOME": str(self.folder), "PATH": f"{self.folder}:{os.environ['PATH']}"}
-        out = run("fish", "--no-config", "-c", "source $argv[1]; complete -C $argv[2]", str(COMPLETIONS / "fish"), line,
-                  cwd=self.folder, env=environment)
+        out = run("fish", "--no-config", "-c", "source $argv[1]; complete -C $argv[2]",
+                  str(COMPLETIONS / "fish" / line.split()[0]), line, cwd=self.folder, env=self.environment)
         return {each.split("\t")[0] for each in out.splitlines() if each}
 
 
@@ -110,10 +135,12 @@ class Zsh(Offers, unittest.TestCase):
     """
 
     def offered(self, line):
-        return set(run("zsh", "-f", "-c", self.SCRIPT, "zsh", str(COMPLETIONS / "zsh"), line, cwd=self.folder).split())
+        return set(run("zsh", "-f", "-c", self.SCRIPT, "zsh", str(COMPLETIONS / "zsh" / line.split()[0]), line,
+                       cwd=self.folder, env=self.environment).split())
 
-    def test_it_is_for_bvhelperctl(self):
-        self.assertEqual((COMPLETIONS / "zsh").read_text().splitlines()[0], "#compdef bvhelperctl")
+    def test_it_says_for_what_it_is(self):
+        for name in ("bvhelperctl", "brenvik-standin"):
+            self.assertEqual((COMPLETIONS / "zsh" / name).read_text().splitlines()[0], f"#compdef {name}")
 
 
 if __name__ == "__main__":

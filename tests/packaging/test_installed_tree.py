@@ -62,7 +62,10 @@ class InstalledTree(unittest.TestCase):
                         r"lib/systemd/catalog/brenvik-mobile-helper\.catalog", r"lib/sysusers\.d/brenvik-mobile-helper\.conf",
                         r"lib/tmpfiles\.d/brenvik-mobile-helper\.conf", r"lib/sysctl\.d/10-brenvik-mobile-helper\.conf",
                         r"share/bash-completion/completions/bvhelperctl", r"share/zsh/vendor-completions/_bvhelperctl",
-                        r"share/fish/vendor_completions\.d/bvhelperctl\.fish"):
+                        r"share/fish/vendor_completions\.d/bvhelperctl\.fish",
+                        r"share/bash-completion/completions/brenvik-standin", r"share/zsh/vendor-completions/_brenvik-standin",
+                        r"share/fish/vendor_completions\.d/brenvik-standin\.fish",
+                        r"share/bvhelperctl/schemas/bvhelperctl\.schema\.json"):
             self.one(pattern)
         self.assertTrue((self.root / "etc/brenvik/entitlements.d").is_dir())
         self.assertTrue((self.root / "usr/lib/brenvik/entitlements.d").is_dir())

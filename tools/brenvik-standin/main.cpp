@@ -1,51 +1,63 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include <CLI/CLI.hpp>
 #include <cstdint>
-#include <cstdio>
-#include <limits>
-#include <string>
+#include <exception>
+#include <nlohmann/json.hpp>
 
+#include "tools/support/CommandLineParser.h"
 #include "tools/support/EventStream.h"
+#include "tools/support/Output.h"
+#include "tools/support/StandInSyntax.h"
 
 // A telephony daemon that only listens: takes the helper's pushes and notifications, answers as it is told,
 // and prints them.
-int main(int argc, char** argv) {
-  using brenvik::tools::EventStreamOptions;
-  constexpr int kWrongUsage = 2;
-  try {
-    EventStreamOptions options;
-    options.program = "brenvik-standin";
-    bool hangs = false;
-    std::uint64_t most = 0;
-    std::uint32_t helperUid = 0;
-    CLI::App app(
-        "Stands in for the telephony daemon: prints the helper's pushes and notifications, and answers.",
-        options.program);
-    app.set_version_flag("--version", "brenvik-standin " BRENVIK_VERSION);
-    app.add_flag("--json", options.asJson, "print one JSON object a line");
-    CLI::Option* refuse =
-        app.add_option("--refuse", options.errorCode, "answer every push with this error code")
-            ->option_text("CODE")
-            ->check(CLI::Range(1, std::numeric_limits<int>::max()));
-    app.add_flag("--hang", hangs, "never answer a push")->excludes(refuse);
-    CLI::Option* count = app.add_option("--count", most, "leave after so many pushes and notifications")
-                             ->option_text("N")
-                             ->check(CLI::Range(1, std::numeric_limits<int>::max()));
-    app.add_option("--directory", options.directory, "folder of named services")->option_text("DIR");
-    CLI::Option* uid =
-        app.add_option("--helper-uid", helperUid, "take messages from this user too")->option_text("UID");
-    try {
-      app.parse(argc, argv);
-    } catch (const CLI::ParseError& error) {
-      return app.exit(error) == 0 ? 0 : kWrongUsage;
-    }
-    options.answers = !hangs;
-    if (count->count() != 0) options.most = most;
-    if (uid->count() != 0) options.helperUid = helperUid;
-    return brenvik::tools::printEvents(options);
-  } catch (const std::exception& error) {
-    std::fprintf(stderr, "brenvik-standin: %s\n", error.what());
-    return kWrongUsage;
+namespace {
+
+using namespace brenvik::tools;
+
+EventStreamOptions optionsIn(const Values& given) {
+  EventStreamOptions options;
+  options.program = kStandInName;
+  options.asJson = given.has("--json");
+  options.answers = !given.has("--hang");
+  options.directory = given.get("--directory", "");
+  if (given.has("--refuse")) {
+    if (given.has("--hang")) throw UsageError{"--hang and --refuse exclude each other"};
+    options.errorCode = *numberIn<std::int32_t>(given["--refuse"]);
   }
+  if (given.has("--count")) options.most = numberIn<std::uint64_t>(given["--count"]);
+  if (given.has("--timeout")) options.seconds = secondsIn(given["--timeout"]);
+  if (given.has("--helper-uid")) options.helperUid = numberIn<std::uint32_t>(given["--helper-uid"]);
+  return options;
+}
+
+ExitStatus run(int argc, char** argv) {
+  const ProgramSyntax syntax = standInSyntax();
+  const ParsedLine line = parseCommandLine(syntax, argc, argv);
+  if (line.wish != ParsedLine::Wish::command) {
+    const bool asJson = isFlagGiven("--json", argc, argv);
+    (void)printOut(line.wish == ParsedLine::Wish::help ? helpOutput(syntax, line, asJson)
+                                                       : versionOutput(syntax, BRENVIK_VERSION, asJson));
+    return ExitStatus::done;
+  }
+  return printEvents(optionsIn(checkedValues({}, *syntax.globalOptions, line.globals)));
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  prepareStandardStreams();
+  ExitStatus status = ExitStatus::usage;
+  try {
+    status = run(argc, argv);
+  } catch (const UsageError& error) {
+    printFailure(kStandInName, isFlagGiven("--json", argc, argv), error.message,
+                 error.isAboutSyntax ? "Run with --help for more." : error.advice,
+                 nlohmann::ordered_json::object());
+  } catch (const std::exception& error) {
+    status = ExitStatus::failed;
+    printFailure(kStandInName, isFlagGiven("--json", argc, argv), error.what(), "",
+                 nlohmann::ordered_json::object());
+  }
+  return finishOutput(kStandInName, status);
 }

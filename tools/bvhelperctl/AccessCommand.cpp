@@ -7,10 +7,10 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <charconv>
-#include <cstdio>
 #include <cstring>
 #include <optional>
 #include <utility>
@@ -22,8 +22,6 @@
 
 namespace brenvik::tools {
 namespace {
-
-enum ExitStatus { kGranted = 0, kCannotTell = 1, kRefused = 4 };
 
 constexpr const char kEntitlement[] = "com.norvale.Teravox.BrenvikHelper.allow";
 
@@ -147,54 +145,61 @@ std::string verdictOn(const EntitlementSearch::Result& result,
   return result.value.asBoolean() == true ? result.file + " gives it" : whyNotEntitled(result, findings);
 }
 
-void printJson(const Asked& asked, const EntitlementSearch::Result& result,
-               const std::vector<EntitlementFinding>& findings) {
+nlohmann::ordered_json fieldsOf(const Asked& asked, const EntitlementSearch::Result& result,
+                                const std::vector<EntitlementFinding>& findings) {
   nlohmann::ordered_json steps = nlohmann::ordered_json::array();
   for (const EntitlementFinding& each : findings) {
     steps.push_back(
         {{"path", each.path}, {"key", each.key}, {"result", nameOf(each.kind)}, {"text", each.text}});
   }
-  nlohmann::ordered_json line{{"ok", !result.error}, {"granted", result.value.asBoolean() == true}};
-  line["caller"] = {
+  nlohmann::ordered_json fields{{"ok", !result.error}, {"granted", result.value.asBoolean() == true}};
+  fields["caller"] = {
       {"executable", asked.executable}, {"uid", asked.uid}, {"account", asked.account}, {"unit", asked.unit}};
-  line["entitlement"] = kEntitlement;
-  line[result.error ? "error" : "reason"] = verdictOn(result, findings);
-  line["steps"] = std::move(steps);
-  std::printf("%s\n", jsonLine(line).c_str());
+  fields["entitlement"] = kEntitlement;
+  fields[result.error ? "error" : "reason"] = verdictOn(result, findings);
+  fields["steps"] = std::move(steps);
+  return fields;
 }
 
-void printText(const Asked& asked, const EntitlementSearch::Result& result,
-               const std::vector<EntitlementFinding>& findings) {
+// The word, filled up to a column of that width.
+std::string column(std::string word, std::size_t width) {
+  word.resize(std::max(word.size(), width), ' ');
+  return word;
+}
+
+std::string textOf(const Asked& asked, const EntitlementSearch::Result& result,
+                   const std::vector<EntitlementFinding>& findings) {
+  std::string text;
   for (const std::string& script : asked.scripts) {
-    std::printf("%s is a script: what runs is its interpreter\n", printable(script).c_str());
+    text += printable(script) + " is a script: what runs is its interpreter\n";
   }
   const std::string account = asked.account.empty() ? std::to_string(asked.uid)
                                                     : asked.account + " (" + std::to_string(asked.uid) + ")";
-  std::printf("executable  %s\naccount     %s\nunit        %s\nasks for    %s\n",
-              printable(asked.executable).c_str(), printable(account).c_str(),
-              asked.unit.empty() ? "none" : printable(asked.unit).c_str(), kEntitlement);
+  constexpr std::size_t kFacts = 12;  // columns
+  text += column("executable", kFacts) + printable(asked.executable) + '\n';
+  text += column("account", kFacts) + printable(account) + '\n';
+  text += column("unit", kFacts) + (asked.unit.empty() ? "none" : printable(asked.unit)) + '\n';
+  text += column("asks for", kFacts) + kEntitlement + '\n';
   std::string path;
   for (const EntitlementFinding& each : findings) {
     if (each.path != path) {
       path = each.path;
-      std::printf("\n%s\n", printable(path).c_str());
+      text += '\n' + printable(path) + '\n';
     }
     const std::string subject = each.key.empty() ? "" : each.key + ' ';
-    std::printf("  %-8s %s\n", nameOf(each.kind), printable(subject + each.text).c_str());
+    text += "  " + column(nameOf(each.kind), 9) + printable(subject + each.text) + '\n';
   }
   const char* const verdict = result.error                       ? "cannot be told"
                               : result.value.asBoolean() == true ? "let in"
                                                                  : "refused";
-  std::printf("\n%s: %s\n", verdict, printable(verdictOn(result, findings)).c_str());
+  return text + '\n' + verdict + ": " + printable(verdictOn(result, findings));
 }
 
 }  // namespace
 
-int printAccess(bool asJson, const Values& values) {
-  return printAccess(asJson, values, entitlementDirectories());
-}
+Outcome explainAccess(const Values& values) { return explainAccess(values, entitlementDirectories()); }
 
-int printAccess(bool asJson, const Values& values, std::vector<std::string> directories) {
+Outcome explainAccess(const Values& values, std::vector<std::string> directories) {
   PasswordDatabase accounts;
   Asked asked;
   takeExecutable(values, &asked);
@@ -205,9 +210,13 @@ int printAccess(bool asJson, const Values& values, std::vector<std::string> dire
   ImaginedCaller caller(asked.executable, asked.uid, asked.unit);
   std::vector<EntitlementFinding> findings;
   const EntitlementSearch::Result result = search.find(kEntitlement, caller, &findings);
-  asJson ? printJson(asked, result, findings) : printText(asked, result, findings);
-  if (result.error) return kCannotTell;
-  return result.value.asBoolean() == true ? kGranted : kRefused;
+  Outcome outcome;
+  outcome.fields = fieldsOf(asked, result, findings);
+  outcome.text = textOf(asked, result, findings);
+  outcome.status = result.error                       ? ExitStatus::failed
+                   : result.value.asBoolean() == true ? ExitStatus::done
+                                                      : ExitStatus::refused;
+  return outcome;
 }
 
 }  // namespace brenvik::tools

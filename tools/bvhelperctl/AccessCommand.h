@@ -9,12 +9,12 @@
 
 namespace brenvik::tools {
 
-// "access": goes through the entitlement files with the helper's own code and prints each step. Needs no
-// helper. Returns the exit status: 0 when the caller would be let in, 4 when it would be refused, 1 when that
-// cannot be told. Throws UsageError.
-int printAccess(bool asJson, const Values& values);
+// "access": goes through the entitlement files with the helper's own code and shows each step. Needs no helper.
+// The outcome's status is `done` when the caller would be let in, `refused` when it would not, and `failed` when
+// that cannot be told. Throws UsageError.
+Outcome explainAccess(const Values& values);
 
 // The same with the files of other directories.
-int printAccess(bool asJson, const Values& values, std::vector<std::string> directories);
+Outcome explainAccess(const Values& values, std::vector<std::string> directories);
 
 }  // namespace brenvik::tools

@@ -50,21 +50,20 @@ class AccessCommandTest : public testing::Test {
     return path;
   }
 
-  // The exit status; what was printed is in `printed`.
+  // The exit status; what is printed is in `printed`.
   int run(const std::vector<std::pair<std::string, std::string>>& given, bool asJson = false) {
     Values values;
     for (const auto& [name, value] : given) values.add(name, value);
-    testing::internal::CaptureStdout();
-    const int status = printAccess(asJson, values, {(root / "etc").string(), (root / "lib").string()});
-    (void)std::fflush(stdout);
-    printed = testing::internal::GetCapturedStdout();
-    return status;
+    const Outcome outcome = explainAccess(values, {(root / "etc").string(), (root / "lib").string()});
+    printed = (asJson ? outcome.fields.dump() : outcome.text) + '\n';
+    EXPECT_EQ(*outcome.routine, '\0');
+    EXPECT_TRUE(outcome.isDone);
+    return static_cast<int>(outcome.status.value());
   }
   std::string messageOf(const std::vector<std::pair<std::string, std::string>>& given) {
     try {
       (void)run(given);
     } catch (const UsageError& error) {
-      (void)testing::internal::GetCapturedStdout();
       return error.message;
     }
     return "taken";

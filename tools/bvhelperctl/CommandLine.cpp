@@ -6,29 +6,26 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <CLI/CLI.hpp>
-#include <algorithm>
 #include <array>
-#include <chrono>
 #include <cmath>
 #include <cstdio>
 #include <cstring>
-#include <deque>
 #include <memory>
+#include <new>
 #include <optional>
 #include <string>
 
-#include "tools/bvhelperctl/AccessCommand.h"
 #include "tools/bvhelperctl/CommandTable.h"
+#include "tools/bvhelperctl/Completion.h"
 #include "tools/support/EventStream.h"
+#include "tools/support/ExitStatus.h"
+#include "tools/support/Output.h"
 #include "tools/support/PropertyListText.h"
 
 namespace brenvik::tools {
 namespace {
 
 constexpr const char* kProgram = "bvhelperctl";
-
-enum ExitStatus { kDone = 0, kRefused = 1, kUnusable = 2 };
 
 struct Settings {
   bool asJson = false;
@@ -43,20 +40,10 @@ using ClientPointer = std::unique_ptr<bvmh_client, FreeClient>;
 
 // ---- what the user sees ---------------------------------------------------------------------------------
 
-void printJson(const nlohmann::ordered_json& value) { std::printf("%s\n", jsonLine(value).c_str()); }
-
-int fail(const Settings& settings, ExitStatus status, const std::string& message,
-         const std::string& advice = "", nlohmann::ordered_json fields = nlohmann::ordered_json::object()) {
-  if (settings.asJson) {
-    nlohmann::ordered_json line{{"ok", false}};
-    line.update(fields);
-    line["error"] = message;
-    if (!advice.empty()) line["advice"] = advice;
-    printJson(line);
-  } else {
-    std::fprintf(stderr, "%s: %s\n", kProgram, message.c_str());
-    if (!advice.empty()) std::fprintf(stderr, "%s\n", advice.c_str());
-  }
+ExitStatus fail(const Settings& settings, ExitStatus status, const std::string& message,
+                const std::string& advice = "",
+                const nlohmann::ordered_json& fields = nlohmann::ordered_json::object()) {
+  printFailure(kProgram, settings.asJson, message, advice, fields);
   return status;
 }
 
@@ -113,197 +100,145 @@ bool isTransportFailure(std::int32_t code) { return code >= BVMH_ERROR_FIRST && 
 
 std::string socketOf(const Settings& settings) { return settings.socket.value_or(bvmh_service_socket()); }
 
-int reportCode(const Settings& settings, bvmh_client* client, const char* routine, std::int32_t code,
-               const std::string& failure) {
-  const nlohmann::ordered_json fields{{"routine", routine}, {"code", code}};
-  const std::string text = bvmh_error_text(code);
-  const int error = bvmh_client_errno(client);
+ExitStatus reportCode(const Settings& settings, bvmh_client* client, const Outcome& outcome) {
+  nlohmann::ordered_json fields{{"routine", outcome.routine}, {"code", outcome.code}};
+  fields.update(outcome.fieldsOfFailure);
+  const std::string text = bvmh_error_text(outcome.code);
+  const int error = client == nullptr ? 0 : bvmh_client_errno(client);
   const std::string reason = error == 0 ? "" : std::string(": ") + std::strerror(error);
-  switch (code) {
+  const std::string& failure = outcome.failure.empty() ? text : outcome.failure;
+  const ExitStatus status = outcome.status.value_or(statusOfCode(outcome.code));
+  switch (outcome.code) {
     case BVMH_ERROR_UNREACHABLE:
-      return fail(settings, kUnusable, "cannot reach the helper at " + printable(socketOf(settings)) + reason,
+      return fail(settings, status, "cannot reach the helper at " + printable(socketOf(settings)) + reason,
                   "Is BrenvikMobileHelper installed, and its socket unit started? systemctl status "
                   "brenvik-mobile-helper.socket tells.",
                   fields);
     case BVMH_ERROR_TIMED_OUT: {
       std::array<char, 32> seconds{};
       std::snprintf(seconds.data(), seconds.size(), "%g", settings.timeout);
-      return fail(settings, kUnusable, std::string("no answer in ") + seconds.data() + " s",
+      return fail(settings, status, std::string("no answer in ") + seconds.data() + " s",
                   "The request may still be carried out. --timeout waits longer.", fields);
     }
     case BVMH_INVALID_SECURITY:
       if (error == EACCES) {
-        return fail(settings, kRefused,
+        return fail(settings, status,
                     "refused: this account may not connect to " + printable(socketOf(settings)),
                     groupAdvice(), fields);
       }
-      return fail(settings, kRefused, "refused: " + text, entitlementAdvice(), fields);
+      return fail(settings, status, "refused: " + text, entitlementAdvice(), fields);
     case BVMH_NO_ACCESS:
-      return fail(settings, kRefused, "refused: " + (failure.empty() ? text : failure), "", fields);
+      return fail(settings, status, "refused: " + failure, "", fields);
     default:
       break;
   }
-  if (isTransportFailure(code)) return fail(settings, kUnusable, text + reason, "", fields);
-  return fail(settings, kRefused, (failure.empty() ? text : failure) + " (code " + std::to_string(code) + ")",
-              "", fields);
+  if (isTransportFailure(outcome.code)) return fail(settings, status, text + reason, "", fields);
+  return fail(settings, status, failure + " (code " + std::to_string(outcome.code) + ")", "", fields);
 }
 
-int report(const Settings& settings, bvmh_client* client, const Outcome& outcome) {
-  if (outcome.code != BVMH_OK)
-    return reportCode(settings, client, outcome.routine, outcome.code, outcome.failure);
-  nlohmann::ordered_json fields{{"routine", outcome.routine}, {"code", outcome.code}};
-  if (!outcome.isDone) return fail(settings, kRefused, outcome.failure, "", fields);
+ExitStatus report(const Settings& settings, bvmh_client* client, const Outcome& outcome) {
+  if (outcome.code != BVMH_OK) return reportCode(settings, client, outcome);
+  nlohmann::ordered_json fields = nlohmann::ordered_json::object();
+  if (*outcome.routine != '\0') fields = {{"routine", outcome.routine}, {"code", outcome.code}};
+  if (!outcome.isDone) {
+    fields.update(outcome.fieldsOfFailure);
+    return fail(settings, outcome.status.value_or(ExitStatus::failed), outcome.failure, outcome.advice,
+                fields);
+  }
+  // A loss is told at the end.
   if (settings.asJson) {
     nlohmann::ordered_json line{{"ok", true}};
     line.update(fields);
     line.update(outcome.fields);
-    printJson(line);
+    if (!outcome.notes.empty()) line["notes"] = outcome.notes;
+    (void)printOut(jsonLine(line) + '\n');
+  } else if (outcome.raw) {
+    (void)printOut(*outcome.raw);
   } else if (!outcome.text.empty()) {
-    std::printf("%s\n", outcome.text.c_str());
+    (void)printOut(outcome.text + '\n');
   }
-  return kDone;
+  if (!settings.asJson) {
+    for (const std::string& each : outcome.notes)
+      std::fprintf(stderr, "%s: note: %s\n", kProgram, each.c_str());
+  }
+  return outcome.status.value_or(ExitStatus::done);
 }
 
 // ---- running a command ----------------------------------------------------------------------------------
 
-int watch(const Settings& settings, const Values& values) {
+ExitStatus watch(const Settings& settings, const Values& values) {
   EventStreamOptions options;
   options.program = kProgram;
   options.asJson = settings.asJson;
   options.directory = values.get("--directory", "");
-  if (values.has("--count")) options.most = std::stoull(values["--count"]);
-  if (values.has("--helper-uid"))
-    options.helperUid = static_cast<std::uint32_t>(std::stoul(values["--helper-uid"]));
+  if (values.has("--count")) options.most = numberIn<std::uint64_t>(values["--count"]);
+  if (values.has("--timeout")) options.seconds = secondsIn(values["--timeout"]);
+  if (values.has("--helper-uid")) options.helperUid = numberIn<std::uint32_t>(values["--helper-uid"]);
   return printEvents(options);
 }
 
-int run(const Settings& settings, const Command& command, const Values& values) {
-  if (command.isLocal && std::strcmp(command.name, "access") == 0)
-    return printAccess(settings.asJson, values);
-  if (command.isLocal) return watch(settings, values);
+ExitStatus run(const Settings& settings, const Command& command, const Values& values) {
+  if (command.run == nullptr) return watch(settings, values);
+  if (command.isLocal) return report(settings, nullptr, command.run(nullptr, values));
   const ClientPointer client(bvmh_client_create());
-  if (client == nullptr) return fail(settings, kUnusable, "out of memory");
+  if (client == nullptr) throw std::bad_alloc();
   bvmh_client_set_timeout(client.get(), static_cast<std::uint32_t>(std::ceil(settings.timeout * 1000)));
   if (settings.socket && bvmh_client_set_socket(client.get(), settings.socket->c_str()) != BVMH_OK) {
-    return fail(settings, kUnusable, "--socket: the path is empty or too long for a socket");
+    throw UsageError{"--socket: the path is empty or too long for a socket"};
   }
   return report(settings, client.get(), command.run(client.get(), values));
 }
 
-// ---- the parser, from the table -------------------------------------------------------------------------
-
-// A subcommand as the parser sees it; where its values land.
-struct Parsed {
-  const Command* command = nullptr;
-  CLI::App* app = nullptr;
-  struct Slot {
-    const Parameter* parameter;
-    CLI::Option* option;
-    std::vector<std::string> values;
-    std::size_t taken = 0;
-  };
-  std::deque<Slot> slots;  // the parser keeps pointers to them
-};
-
-void addParameter(Parsed& parsed, const Parameter& parameter, bool isPositional) {
-  Parsed::Slot& slot = parsed.slots.emplace_back(Parsed::Slot{&parameter, nullptr, {}, 0});
-  slot.option = parsed.app->add_option(parameter.name, slot.values, parameter.help);
-  slot.option->allow_extra_args(false);
-  if (isPositional) {
-    slot.option->required()->expected(1)->option_text(" ");
-  } else {
-    slot.option->option_text(parameter.valueName);
-    if (!parameter.isRepeatable) slot.option->multi_option_policy(CLI::MultiOptionPolicy::Throw)->expected(1);
+ExitStatus runLine(Settings& settings, int argc, const char* const* argv) {
+  const ProgramSyntax syntax = programSyntax();
+  const ParsedLine line = parseCommandLine(syntax, argc, argv);
+  if (line.wish != ParsedLine::Wish::command) {
+    // Asked for before or after it.
+    const bool asJson = isFlagGiven("--json", argc, argv);
+    // A loss is told at the end.
+    (void)printOut(line.wish == ParsedLine::Wish::help ? helpOutput(syntax, line, asJson)
+                                                       : versionOutput(syntax, BRENVIK_VERSION, asJson));
+    return ExitStatus::done;
   }
-}
-
-void addCommand(CLI::App& parent, Parsed& parsed) {
-  const Command& command = *parsed.command;
-  parsed.app = parent.add_subcommand(command.name, command.summary);
-  parsed.app->fallthrough();
-  for (const Parameter& each : command.positionals) addParameter(parsed, each, true);
-  for (const Parameter& each : command.options) addParameter(parsed, each, false);
-}
-
-// The values in the order in which they stood on the command line, checked.
-Values collect(Parsed& parsed) {
-  Values values;
-  for (const CLI::Option* option : parsed.app->parse_order()) {
-    for (Parsed::Slot& slot : parsed.slots) {
-      if (slot.option != option || slot.taken == slot.values.size()) continue;
-      values.add(slot.parameter->name, checkedValue(*slot.parameter, slot.values[slot.taken++]));
-    }
+  const Command& command = commandTable()[*line.command];
+  settings.asJson = line.globals.has("--json");
+  // The library says whether the path of a socket will do.
+  if (line.globals.has("--socket")) settings.socket = line.globals["--socket"];
+  if (line.globals.has("--timeout")) {
+    settings.timeout =
+        secondsIn(checkedValue(parameterNamed(globalOptions(), "--timeout"), line.globals["--timeout"]));
   }
-  return values;
+  Values values = checkedValues(command.positionals, command.options, line.given);
+  for (const auto& [name, value] : line.globals.all()) values.add(name, value);
+  return run(settings, command, values);
 }
-
-const Parameter& globalOption(std::string_view name) {
-  const auto& all = globalOptions();
-  return *std::find_if(all.begin(), all.end(), [&](const Parameter& each) { return name == each.name; });
-}
-
-constexpr const char* kStatuses =
-    "Exit status: 0 done; 1 the helper refused or could not do it; 2 wrong usage, or no helper.";
 
 }  // namespace
 
 int runCommandLine(int argc, const char* const* argv) {
+  prepareStandardStreams();
   Settings settings;
-  // A program that asked for JSON gets it for wrong usage too, which the parser may meet first.
-  const auto wantsJson = [&] {
-    for (int i = 1; i < argc && std::strcmp(argv[i], "--") != 0; ++i) {
-      if (std::strcmp(argv[i], "--json") == 0) return true;
-    }
-    return false;
-  };
+  ExitStatus status = ExitStatus::failed;
   try {
-    CLI::App app("Asks BrenvikMobileHelper for what it does for the telephony daemon.", kProgram);
-    app.require_subcommand(1);
-    app.set_version_flag("--version", std::string(kProgram) + " " BRENVIK_VERSION);
-    std::string timeout;
-    app.add_flag("--json", settings.asJson, globalOption("--json").help);
-    app.add_option("--timeout", timeout, globalOption("--timeout").help)->option_text("SECONDS");
-    app.add_option("--socket", settings.socket, globalOption("--socket").help)->option_text("PATH");
-    // Of the groups and commands, which are added below.
-    app.footer(std::string("--json, --timeout and --socket may stand here, too: see ") + kProgram +
-               " --help.\n" + kStatuses);
-
-    std::map<std::string, CLI::App*> groups;
-    for (const Group& each : commandGroups()) {
-      CLI::App* group = app.add_subcommand(each.name, each.summary);
-      group->require_subcommand(1)->fallthrough();
-      groups[each.name] = group;
+    if (isCompletionRequest(argc, argv)) {
+      status = printOffers(argc, argv);
+    } else {
+      status = runLine(settings, argc, argv);
     }
-    std::deque<Parsed> commands;
-    for (const Command& each : commandTable()) {
-      Parsed& parsed = commands.emplace_back();
-      parsed.command = &each;
-      addCommand(*each.group == '\0' ? app : *groups.at(each.group), parsed);
-    }
-    app.footer(kStatuses);
-    try {
-      app.parse(argc, argv);
-    } catch (const CLI::ParseError& error) {
-      // Help and version come this way too.
-      if (error.get_exit_code() == 0) return app.exit(error) == 0 ? kDone : kUnusable;
-      settings.asJson = wantsJson();
-      const std::vector<std::string> unknown = app.remaining(true);
-      const std::string message =
-          unknown.empty() ? error.what() : "not expected: " + printable(unknown.front());
-      return fail(settings, kUnusable, message, "Run with --help for more.");
-    }
-    if (app.count("--timeout") != 0) {
-      settings.timeout = secondsIn(checkedValue(globalOption("--timeout"), timeout));
-    }
-    for (Parsed& each : commands) {
-      if (each.app->parsed()) return run(settings, *each.command, collect(each));
-    }
-    return fail(settings, kUnusable, "no command");
   } catch (const UsageError& error) {
-    return fail(settings, kUnusable, error.message);
+    // A program that asked for JSON gets it for wrong usage too, which may have been met before the wish.
+    settings.asJson = isFlagGiven("--json", argc, argv);
+    const std::string advice =
+        error.advice.empty() && error.isAboutSyntax ? "Run with --help for more." : error.advice;
+    status = fail(settings, ExitStatus::usage, error.message, advice);
+  } catch (const std::bad_alloc&) {
+    // Nothing here may need memory.
+    static constexpr char kMessage[] = "bvhelperctl: out of memory\n";
+    (void)!::write(STDERR_FILENO, kMessage, sizeof kMessage - 1);
   } catch (const std::exception& error) {
-    return fail(settings, kUnusable, error.what());
+    status = fail(settings, ExitStatus::failed, error.what());
   }
+  return finishOutput(kProgram, status);
 }
 
 }  // namespace brenvik::tools

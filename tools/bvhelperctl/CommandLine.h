@@ -4,8 +4,7 @@
 
 namespace brenvik::tools {
 
-// The whole program. Exit status: 0 done, 1 the helper refused or could not do it, 2 wrong usage or no
-// helper.
+// The whole program. Returns one of ExitStatus (tools/support/ExitStatus.h).
 int runCommandLine(int argc, const char* const* argv);
 
 }  // namespace brenvik::tools

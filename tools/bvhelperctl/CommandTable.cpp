@@ -2,41 +2,30 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "tools/bvhelperctl/CommandTable.h"
 
-#include <algorithm>
-#include <array>
-#include <cerrno>
-#include <charconv>
-#include <cmath>
-#include <cstdio>
-#include <cstring>
-#include <filesystem>
-#include <memory>
-#include <system_error>
+#include <pwd.h>
+#include <unistd.h>
 
-#include "platform/base/Utf8.h"
+#include <algorithm>
+#include <cerrno>
+#include <span>
+
 #include "platform/plist/PropertyListCodec.h"
+#include "tools/bvhelperctl/AccessCommand.h"
+#include "tools/bvhelperctl/Call.h"
+#include "tools/bvhelperctl/Switches.h"
+#include "tools/bvhelperctl/Waiting.h"
 #include "tools/support/Base64.h"
 #include "tools/support/PropertyListText.h"
+#include "tools/support/StandInSyntax.h"
 
 namespace brenvik::tools {
 namespace {
 
 // ---- values ---------------------------------------------------------------------------------------------
 
-template <class Number>
-std::optional<Number> numberIn(const std::string& text) {
-  Number number{};
-  const char* end = text.data() + text.size();
-  const auto [stop, error] = std::from_chars(text.data(), end, number);
-  if (error != std::errc() || stop != end || text.empty()) return std::nullopt;
-  return number;
-}
-
-double degrees(const std::string& text) { return numberIn<double>(text).value_or(0); }
-
-PropertyList valueOfType(const std::string& type, const std::string& text) {
+PropertyList valueOfType(const std::string& type, const std::string& text, bool isSecret = false) {
   const auto wrong = [&](const char* what) {
-    return UsageError{"\"" + printable(text) + "\" is not " + what};
+    return UsageError{(isSecret ? "what was read" : '"' + printable(text) + '"') + " is not " + what};
   };
   if (type == "integer") {
     if (const auto number = numberIn<std::int64_t>(text)) return PropertyList::integer(*number);
@@ -52,6 +41,7 @@ PropertyList valueOfType(const std::string& type, const std::string& text) {
     if (text == "false" || text == "no" || text == "0") return PropertyList::boolean(false);
     throw wrong("true or false");
   }
+  if (type == "bytes") return PropertyList::data(std::as_bytes(std::span(text)));
   if (type == "data") {
     if (const auto bytes = fromBase64(text)) return PropertyList::data(*bytes);
     throw wrong("base64");
@@ -61,24 +51,46 @@ PropertyList valueOfType(const std::string& type, const std::string& text) {
   return string;
 }
 
-std::string propertyListFile(const std::string& path) {
-  const auto unreadable = [&] {
-    return UsageError{"cannot read " + printable(path) + ": " + std::strerror(errno)};
-  };
-  struct Close {
-    void operator()(std::FILE* file) const { (void)std::fclose(file); }  // only read from
-  };
-  const std::unique_ptr<std::FILE, Close> file(std::fopen(path.c_str(), "rbe"));
-  if (file == nullptr) throw unreadable();
-  std::string content;
-  std::array<char, 65536> part;
-  while (const std::size_t count = std::fread(part.data(), 1, part.size(), file.get()))
-    content.append(part.data(), count);
-  if (std::ferror(file.get()) != 0) throw unreadable();
-  if (!parsePropertyList(std::as_bytes(std::span(content)))) {
-    throw UsageError{printable(path) + " is not a property list"};
+std::string serialized(const PropertyList& value) {
+  auto bytes = serializePropertyList(value, PropertyListFormat::binary);
+  if (!bytes) throw UsageError{"the value is too large for a property list"};
+  return *std::move(bytes);
+}
+
+// The helper answers with XML. A value that XML cannot say would be stored, never be read back, and take its
+// whole domain from whoever reads that as a file.
+void mustFitXml(const PropertyList& value) {
+  if (serializePropertyList(value, PropertyListFormat::xml)) return;
+  throw UsageError{
+      "VALUE cannot be read back as XML: a text in it holds a control character, a date is outside "
+      "the years that can be written, or it is too deep or too large",
+      "--type bytes stores any bytes as data; prefs get --raw reads them back."};
+}
+
+// What is sent for VALUE: a property list.
+std::string valueToStore(const Values& values) {
+  const std::string type = values.get("--type", "string");
+  const std::string& given = values["VALUE"];
+  const bool isElsewhere = !values.has("--literal") && ValueReader::standsElsewhere(given);
+  // In a document or in data a newline at the end may mean something.
+  const LastNewline lastNewline =
+      type == "plist-file" || type == "bytes" ? LastNewline::keep : LastNewline::drop;
+  ValueReader reader;
+  const std::string text = isElsewhere ? reader.read("VALUE", given, lastNewline) : given;
+  if (type != "plist-file") {
+    const PropertyList value = valueOfType(type, text, isElsewhere);
+    mustFitXml(value);
+    return serialized(value);
   }
-  return content;
+  std::string document = isElsewhere ? text : contentOf(given);
+  const PropertyList value = parsePropertyList(std::as_bytes(std::span(document)));
+  if (!value) {
+    const std::string name =
+        given == "-" ? "standard input" : printable(isElsewhere ? given.substr(1) : given);
+    throw UsageError{name + " is not a property list"};
+  }
+  mustFitXml(value);
+  return document;
 }
 
 // The helper stores nothing under such a name, and its answer does not say so.
@@ -90,21 +102,7 @@ const std::string& domainOfAFile(const std::string& domain) {
   return domain;
 }
 
-std::string serialized(const PropertyList& value) {
-  auto bytes = serializePropertyList(value, PropertyListFormat::binary);
-  if (!bytes) throw UsageError{"the value is too large for a property list"};
-  return *std::move(bytes);
-}
-
 // ---- outcomes -------------------------------------------------------------------------------------------
-
-Outcome did(const char* routine, std::int32_t code, std::string text) {
-  Outcome outcome;
-  outcome.routine = routine;
-  outcome.code = code;
-  outcome.text = std::move(text);
-  return outcome;
-}
 
 // Of a routine that answers whether its work succeeded.
 Outcome triedTo(const char* routine, std::int32_t code, bool success, std::string text, std::string failure) {
@@ -116,36 +114,41 @@ Outcome triedTo(const char* routine, std::int32_t code, bool success, std::strin
   return outcome;
 }
 
+// A text, or data, byte for byte.
+std::string rawBytes(const PropertyList& value) {
+  if (const auto text = value.asString()) return std::string(*text);
+  if (const auto data = value.asData()) return {reinterpret_cast<const char*>(data->data()), data->size()};
+  return humanText(value) + '\n';
+}
+
 // Shows a returned region, and frees it.
-Outcome returned(const char* routine, std::int32_t code, bvmh_region& region) {
+Outcome returned(const char* routine, std::int32_t code, bvmh_region& region, const Values& values) {
   Outcome outcome = did(routine, code, "");
   if (code != BVMH_OK) return outcome;
   const bool isFound = region.size != 0;
   const PropertyList value = parsePropertyList({static_cast<const std::byte*>(region.bytes), region.size});
   bvmh_region_free(&region);
+  if (isFound && !value) {
+    outcome.isDone = false;
+    outcome.status = ExitStatus::protocol;
+    outcome.failure = "the helper returned something that is no property list";
+    return outcome;
+  }
   outcome.fields["found"] = isFound;
   outcome.fields["value"] = jsonOf(value);
   outcome.text = humanText(value);
-  if (isFound && !value) {
-    outcome.isDone = false;
-    outcome.failure = "the helper returned something that is no property list";
-  }
+  if (values.has("--raw")) outcome.raw = isFound ? rawBytes(value) : "";
+  if (!isFound) outcome.status = ExitStatus::noValue;
   return outcome;
 }
 
 Outcome returnedText(const char* routine, std::int32_t code, const char* name, const std::string& text,
                      const char* none) {
   Outcome outcome = did(routine, code, text.empty() ? none : printable(text));
-  outcome.fields[name] = text;
+  outcome.fields[name] = jsonOfText(text);
+  if (code == BVMH_OK && text.empty()) outcome.status = ExitStatus::noValue;
   return outcome;
 }
-
-// Checks in and calls the routine, whose name is said once for the call and for the outcome. What was given
-// has been checked by then: wrong usage is told whether there is a helper or not.
-#define BVHELPERCTL_CALL(routine, ...)                 \
-  constexpr const char* name = #routine;               \
-  const std::int32_t connected = bvmh_connect(client); \
-  const std::int32_t code = connected != BVMH_OK ? connected : routine(__VA_ARGS__)
 
 // ---- commands -------------------------------------------------------------------------------------------
 
@@ -155,9 +158,7 @@ Outcome ping(bvmh_client* client, const Values&) {
 
 Outcome setPreference(bvmh_client* client, const Values& values) {
   const std::string& domain = domainOfAFile(values["DOMAIN"]);
-  const std::string type = values.get("--type", "string");
-  const std::string value = type == "plist-file" ? propertyListFile(values["VALUE"])
-                                                 : serialized(valueOfType(type, values["VALUE"]));
+  const std::string value = valueToStore(values);
   BVHELPERCTL_CALL(BVMobileHelperSetPreferenceValue, client, domain.c_str(), values["KEY"].c_str(),
                    value.data(), value.size());
   return did(name, code, "set " + printable(values["KEY"]) + " of " + printable(domain));
@@ -174,20 +175,20 @@ Outcome getPreference(bvmh_client* client, const Values& values) {
   bvmh_region region{};
   BVHELPERCTL_CALL(BVMobileHelperCopyPreferenceValue, client, values["DOMAIN"].c_str(), values["KEY"].c_str(),
                    &region);
-  return returned(name, code, region);
+  return returned(name, code, region, values);
 }
 
 Outcome getAppPreference(bvmh_client* client, const Values& values) {
   bvmh_region region{};
   BVHELPERCTL_CALL(BVMobileHelperCopyAppPreferenceValue, client, values["DOMAIN"].c_str(),
                    values["KEY"].c_str(), &region);
-  return returned(name, code, region);
+  return returned(name, code, region, values);
 }
 
 Outcome loadPropertyList(bvmh_client* client, const Values& values) {
   bvmh_region region{};
   BVHELPERCTL_CALL(BVMobileHelperLoadPlistFile, client, values["PATH"].c_str(), &region);
-  Outcome outcome = returned(name, code, region);
+  Outcome outcome = returned(name, code, region, values);
   if (code == BVMH_MEMORY_FAILURE) {
     outcome.failure =
         printable(values["PATH"]) +
@@ -309,60 +310,6 @@ Outcome unpackArchive(bvmh_client* client, const Values& values) {
   return triedTo(name, code, success, "unpacked " + what, "did not unpack " + what);
 }
 
-Outcome switchHeartbeat(bvmh_client* client, const Values& values) {
-  BVHELPERCTL_CALL(BVMobileHelperCellularHeartbeat, client, values["STATE"] == "on" ? 1 : 0);
-  return did(name, code, "cellular heartbeat " + values["STATE"]);
-}
-
-Outcome switchRadioLogs(bvmh_client* client, const Values& values) {
-  BVHELPERCTL_CALL(BVMobileHelperEnableRadioManagerLogs, client, values["STATE"] == "on" ? 1 : 0);
-  return did(name, code, "radio manager logs " + values["STATE"]);
-}
-
-struct DatabaseType {
-  const char* name;
-  std::int32_t bit;
-};
-constexpr DatabaseType kDatabaseTypes[] = {{"gsm", BVMH_LASD_GSM},
-                                           {"umts", BVMH_LASD_UMTS},
-                                           {"cdma", BVMH_LASD_CDMA},
-                                           {"lte", BVMH_LASD_LTE},
-                                           {"scdma", BVMH_LASD_SCDMA}};
-
-Outcome checkDatabases(bvmh_client* client, const Values& values) {
-  std::int32_t mask = 0;
-  if (values.has("--mask")) {
-    if (values.has("--type")) throw UsageError{"--mask and --type say the same: give one of them"};
-    mask = *numberIn<std::int32_t>(values["--mask"]);
-  } else {
-    for (const DatabaseType& type : kDatabaseTypes) {
-      const bool isWanted =
-          !values.has("--type") || std::any_of(values.all().begin(), values.all().end(), [&](auto& each) {
-            return each.first == "--type" && each.second == type.name;
-          });
-      if (isWanted) mask |= type.bit;
-    }
-  }
-  BVHELPERCTL_CALL(BVMobileHelperCheckLASDUpdate, client, mask);
-  Outcome outcome =
-      did(name, code, "update check started; its outcome goes to the telephony daemon (see \"watch\")");
-  outcome.fields["mask"] = mask;
-  return outcome;
-}
-
-constexpr const char* kAnsweredByPush = "asked; the answer goes to the telephony daemon (see \"watch\")";
-
-Outcome requestCivicInfo(bvmh_client* client, const Values& values) {
-  BVHELPERCTL_CALL(BVMobileHelperRequestCountryCodeFromLocation, client, degrees(values["LATITUDE"]),
-                   degrees(values["LONGITUDE"]));
-  return did(name, code, kAnsweredByPush);
-}
-
-Outcome requestWanAddress(bvmh_client* client, const Values&) {
-  BVHELPERCTL_CALL(BVMobileHelperRequestWanIPFromLocation, client);
-  return did(name, code, kAnsweredByPush);
-}
-
 Outcome showCountry(bvmh_client* client, const Values&) {
   char country[BVMH_COUNTRY_CODE_SIZE] = "";
   BVHELPERCTL_CALL(BVMobileHelperCopyCountryCode, client, country, sizeof country);
@@ -410,6 +357,7 @@ Outcome askForLabels(const char* name, LabelsRoutine routine, bvmh_client* clien
   bvmh_region_free(&region);
   if (!result.is(PropertyList::Type::array)) {
     outcome.isDone = false;
+    outcome.status = ExitStatus::protocol;
     outcome.failure = "the helper returned something that is no array of labels";
     return outcome;
   }
@@ -443,12 +391,29 @@ Outcome showLocalizedLabels(bvmh_client* client, const Values& values) {
                       std::move(labels), values);
 }
 
+// Whether there is a contacts store; nothing when this program may not look.
+std::optional<bool> hasContactsStore() {
+  const passwd* mobile = ::getpwnam("mobile");
+  if (mobile == nullptr) return false;
+  const std::string path = std::string(mobile->pw_dir) + "/Library/AddressBook/contacts.db";
+  if (::access(path.c_str(), F_OK) == 0) return true;
+  if (errno == ENOENT || errno == ENOTDIR) return false;
+  return std::nullopt;
+}
+
 Outcome remapChannel(bvmh_client* client, const Values& values) {
   bool success = false;
   BVHELPERCTL_CALL(BVMobileHelperRemapContactsChannel, client, values["FROM"].c_str(), values["TO"].c_str(),
                    &success);
   const std::string what = "contacts from " + printable(values["FROM"]) + " to " + printable(values["TO"]);
-  return triedTo(name, code, success, "moved " + what, "did not move " + what);
+  // The helper answers "done", too, when it cannot open a store, and never how many there were.
+  const std::optional<bool> hasStore = hasContactsStore();
+  Outcome outcome =
+      triedTo(name, code, success,
+              hasStore == false ? "no contacts to move: there is no contacts store" : "remapped " + what,
+              "did not move " + what);
+  outcome.fields["store"] = hasStore ? nlohmann::ordered_json(*hasStore) : nlohmann::ordered_json();
+  return outcome;
 }
 
 // ---- the table ------------------------------------------------------------------------------------------
@@ -459,12 +424,56 @@ constexpr std::size_t kLong = 1023;
 // The domain's file is named DOMAIN.plist, and a file name has at most 255 bytes.
 constexpr std::size_t kDomainName = 249;
 
-const Parameter kDomain{"DOMAIN", "preference domain, such as com.norvale.carrier", ValueKind::text,
-                        kDomainName};
-const Parameter kKey{"KEY", "name of the value", ValueKind::text, kText};
+const Parameter kDomain{"DOMAIN",
+                        "preference domain, such as com.norvale.carrier",
+                        ValueKind::text,
+                        kDomainName,
+                        {},
+                        false,
+                        "VALUE",
+                        ValueSource::argument,
+                        Offer::domains};
+const Parameter kKey{"KEY",   "name of the value",   ValueKind::text, kText, {}, false,
+                     "VALUE", ValueSource::argument, Offer::keys};
+const Parameter kValue{
+    "VALUE",
+    "the value; with --type plist-file, a file. - reads it from standard input, @FILE from a file",
+    ValueKind::bytes,
+    0,
+    {},
+    false,
+    "VALUE",
+    ValueSource::byCommand};
+const Parameter kToken{"TOKEN",
+                       "the token. - reads it from standard input, @FILE from a file",
+                       ValueKind::text,
+                       kText,
+                       {},
+                       false,
+                       "VALUE",
+                       ValueSource::argumentOrFile};
+const Parameter kLiteral{
+    "--literal", "take values that are - or begin with @ as they stand", ValueKind::text, 0, {}, false,
+    nullptr};
+const Parameter kRaw{
+    "--raw", "print a text or data byte for byte, with nothing added", ValueKind::text, 0, {}, false,
+    nullptr};
+const Parameter kWait{"--wait",
+                      "take the telephony daemon's place, and show what it would be told",
+                      ValueKind::text,
+                      0,
+                      {},
+                      false,
+                      nullptr};
 const Parameter kState{"STATE", "on or off", ValueKind::choice, 0, {"on", "off"}};
-const Parameter kTokenKey{
-    "--key", "the token under this key instead of the general one", ValueKind::text, kText, {}, false, "KEY"};
+const Parameter kTokenKey{"--key",
+                          "the token under this key instead of the general one",
+                          ValueKind::text,
+                          kText,
+                          {},
+                          false,
+                          "KEY",
+                          ValueSource::argumentOrFile};
 const Parameter kFlushedDomain{
     "--domain", "preference domain whose cached values are dropped", ValueKind::text, kLong, {}, false,
     "DOMAIN"};
@@ -481,9 +490,19 @@ const Parameter kLabel{
     "(USER_LABEL_...)",
     ValueKind::text,
     0,
-    {},
+    {"primary", "secondary", "personal", "business", "travel", "cell-data", "USER_LABEL_PRIMARY",
+     "USER_LABEL_SECONDARY", "USER_LABEL_PERSONAL", "USER_LABEL_BUSINESS", "USER_LABEL_TRAVEL",
+     "USER_LABEL_CELL_DATA"},
     true,
     "LABEL"};
+const Parameter kLabelText{"--text",
+                           "a label's own text. - reads it from standard input, @FILE from a file",
+                           ValueKind::text,
+                           0,
+                           {},
+                           true,
+                           "TEXT",
+                           ValueSource::argumentOrFile};
 
 Parameter file(const char* name, const char* help, std::size_t limit) {
   return {name, help, ValueKind::path, limit};
@@ -495,36 +514,38 @@ Parameter bytes(const char* name, const char* help, std::size_t limit) {
   return {name, help, ValueKind::bytes, limit};
 }
 
-std::vector<Command> makeTable() {
-  return {
+// The rows are built in place: a start must not pay for copies of them.
+std::span<const Command> makeTable() {
+  static const Command rows[] = {
       {"", "ping", "check in and leave again", {"BVMobileHelperCheckIn"}, {}, {}, ping},
 
       {"prefs",
        "set",
        "store a preference value",
        {"BVMobileHelperSetPreferenceValue"},
-       {kDomain, kKey, bytes("VALUE", "the value; with --type plist-file, a file", 0)},
+       {kDomain, kKey, kValue},
        {{"--type",
-         "string (default), integer, real, bool, data (base64) or plist-file",
+         "string (default), integer, real, bool, data (base64), bytes (data as it stands) or plist-file",
          ValueKind::choice,
          0,
-         {"string", "integer", "real", "bool", "data", "plist-file"},
+         {"string", "integer", "real", "bool", "data", "bytes", "plist-file"},
          false,
-         "TYPE"}},
+         "TYPE"},
+        kLiteral},
        setPreference},
       {"prefs",
        "get",
        "show a preference value",
        {"BVMobileHelperCopyPreferenceValue"},
        {kDomain, kKey},
-       {},
+       {kRaw},
        getPreference},
       {"prefs",
        "get-app",
        "show a preference value in application scope",
        {"BVMobileHelperCopyAppPreferenceValue"},
        {kDomain, kKey},
-       {},
+       {kRaw},
        getAppPreference},
       {"prefs",
        "delete",
@@ -546,8 +567,8 @@ std::vector<Command> makeTable() {
        "set-token",
        "store a voicemail token",
        {"BVMobileHelperSetVoicemailToken", "BVMobileHelperSetVoicemailTokenForKey"},
-       {words("TOKEN", "the token", kText)},
-       {kTokenKey},
+       {kToken},
+       {kTokenKey, kLiteral},
        setVoicemailToken},
       {"voicemail",
        "token",
@@ -646,7 +667,7 @@ std::vector<Command> makeTable() {
        {"BVMobileHelperCheckLASDUpdate"},
        {},
        {{"--type",
-         "gsm, umts, cdma, lte or scdma; may be repeated; default: all",
+         "gsm, umts, cdma, lte or scdma; default: all",
          ValueKind::choice,
          0,
          {"gsm", "umts", "cdma", "lte", "scdma"},
@@ -658,7 +679,16 @@ std::vector<Command> makeTable() {
          0,
          {},
          false,
-         "N"}},
+         "N"},
+        {"--wait",
+         "take the telephony daemon's place, ask for one database after the other, and tell its outcome",
+         ValueKind::text,
+         0,
+         {},
+         false,
+         nullptr},
+        listeningDirectory(),
+        listeningHelperUid()},
        checkDatabases},
 
       {"location",
@@ -667,7 +697,7 @@ std::vector<Command> makeTable() {
        {"BVMobileHelperRequestCountryCodeFromLocation"},
        {{"LATITUDE", "degrees, north is positive", ValueKind::latitude},
         {"LONGITUDE", "degrees, east is positive", ValueKind::longitude}},
-       {},
+       {kWait, listeningDirectory(), listeningHelperUid()},
        requestCivicInfo},
       {"location",
        "country",
@@ -681,7 +711,7 @@ std::vector<Command> makeTable() {
        "ask for the public address of this machine",
        {"BVMobileHelperRequestWanIPFromLocation"},
        {},
-       {},
+       {kWait, listeningDirectory(), listeningHelperUid()},
        requestWanAddress},
 
       {"labels",
@@ -689,7 +719,7 @@ std::vector<Command> makeTable() {
        "show badges of subscription labels",
        {"BVMobileHelperCopyBadgeLabels"},
        {},
-       {kLanguage, kLabel, {"--text", "a label's own text", ValueKind::text, 0, {}, true, "TEXT"}},
+       {kLanguage, kLabel, kLabelText, kLiteral},
        showBadges},
       {"labels",
        "localized",
@@ -723,7 +753,7 @@ std::vector<Command> makeTable() {
        {{"--exe", "program that asks, default this one", ValueKind::path, 0, {}, false, "FILE"},
         {"--user", "account it runs under, default yours", ValueKind::text, 0, {}, false, "USER"},
         {"--unit", "unit of the service manager it runs in", ValueKind::text, 0, {}, false, "UNIT"}},
-       nullptr,
+       [](bvmh_client*, const Values& values) { return explainAccess(values); },
        true},
 
       {"",
@@ -732,26 +762,29 @@ std::vector<Command> makeTable() {
        {},
        {},
        {{"--count", "leave after so many", ValueKind::count, 0, {}, false, "N"},
-        {"--directory", "folder of named services", ValueKind::path, 0, {}, false, "DIR"},
-        {"--helper-uid", "take messages from this user too", ValueKind::user, 0, {}, false, "UID"}},
+        listeningDirectory(),
+        listeningHelperUid()},
        nullptr,
        true},
   };
+  return rows;
 }
 
 }  // namespace
 
-const std::string* Values::find(std::string_view name) const {
-  const auto found =
-      std::find_if(given_.begin(), given_.end(), [&](const auto& each) { return each.first == name; });
-  return found == given_.end() ? nullptr : &found->second;
+Outcome did(const char* routine, std::int32_t code, std::string text) {
+  Outcome outcome;
+  outcome.routine = routine;
+  outcome.code = code;
+  outcome.text = std::move(text);
+  return outcome;
 }
 
 const std::vector<Parameter>& globalOptions() {
   static const std::vector<Parameter> options{
       {"--json", "print one JSON object a line", ValueKind::text, 0, {}, false, nullptr},
       {"--timeout",
-       "seconds to wait for each answer, default 30",
+       "seconds to wait for each answer, default 30; for watch, seconds to listen",
        ValueKind::seconds,
        0,
        {},
@@ -759,7 +792,7 @@ const std::vector<Parameter>& globalOptions() {
        "SECONDS"},
       {"--socket", "the helper's service socket", ValueKind::path, 0, {}, false, "PATH"},
       {"--version", "show the version", ValueKind::text, 0, {}, false, nullptr},
-      {"--help", "show what there is", ValueKind::text, 0, {}, false, nullptr},
+      {"--help", "show this help", ValueKind::text, 0, {}, false, nullptr},
   };
   return options;
 }
@@ -778,71 +811,23 @@ const std::vector<Group>& commandGroups() {
   return groups;
 }
 
-const std::vector<Command>& commandTable() {
-  static const std::vector<Command> table = makeTable();
-  return table;
-}
+std::span<const Command> commandTable() { return makeTable(); }
 
 std::string wordsOf(const Command& command) {
-  return *command.group == '\0' ? command.name : std::string(command.group) + ' ' + command.name;
+  return wordsOf(CommandSyntax{command.group, command.name, command.summary, nullptr, nullptr});
 }
 
-std::string checkedValue(const Parameter& parameter, const std::string& given) {
-  const auto wrong = [&](const std::string& what) {
-    return UsageError{std::string(parameter.name) + ": \"" + printable(given) + "\" is not " + what};
-  };
-  const auto isBetween = [&](double least, double most) {
-    const auto number = numberIn<double>(given);
-    return number && *number >= least && *number <= most;
-  };
-  std::string value = given;
-  switch (parameter.kind) {
-    case ValueKind::text:
-      if (!isValidUtf8(given)) throw wrong("UTF-8");
-      break;
-    case ValueKind::bytes:
-      break;
-    case ValueKind::path: {
-      std::error_code error;
-      if (given.empty()) throw wrong("a path");
-      value = std::filesystem::absolute(given, error).string();
-      if (error) throw wrong("a path from here: " + error.message());
-      break;
-    }
-    case ValueKind::latitude:
-      if (!isBetween(-90, 90)) throw wrong("a latitude, -90 to 90");
-      break;
-    case ValueKind::longitude:
-      if (!isBetween(-180, 180)) throw wrong("a longitude, -180 to 180");
-      break;
-    case ValueKind::integer:
-      if (!numberIn<std::int32_t>(given)) throw wrong("an integer of 32 bits");
-      break;
-    case ValueKind::count:
-      if (numberIn<std::int32_t>(given).value_or(0) < 1) throw wrong("a number from 1 on");
-      break;
-    case ValueKind::user:
-      if (!numberIn<std::uint32_t>(given)) throw wrong("a user's number");
-      break;
-    case ValueKind::seconds:
-      // As milliseconds they must fit 32 bits.
-      if (!isBetween(0.001, 4'000'000)) throw wrong("a number of seconds, 0.001 to 4000000");
-      break;
-    case ValueKind::choice:
-      if (std::none_of(parameter.choices.begin(), parameter.choices.end(),
-                       [&](const char* each) { return given == each; })) {
-        std::string all;
-        for (const char* each : parameter.choices) all += std::string(all.empty() ? "" : ", ") + each;
-        throw wrong("one of: " + all);
-      }
-      break;
+ProgramSyntax programSyntax() {
+  ProgramSyntax syntax{"bvhelperctl",
+                       "Asks BrenvikMobileHelper for what it does for the telephony daemon.",
+                       &commandGroups(),
+                       {},
+                       &globalOptions()};
+  syntax.commands.reserve(commandTable().size());
+  for (const Command& each : commandTable()) {
+    syntax.commands.push_back({each.group, each.name, each.summary, &each.positionals, &each.options});
   }
-  if (parameter.limit != 0 && value.size() > parameter.limit) {
-    throw UsageError{std::string(parameter.name) + ": at most " + std::to_string(parameter.limit) + " bytes"};
-  }
-  return value;
+  return syntax;
 }
-
-double secondsIn(const std::string& value) { return numberIn<double>(value).value_or(0); }
 
 }  // namespace brenvik::tools

@@ -1,9 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 //
-// Prints what is made of bvhelperctl's command table: completions, and the manual page's list of commands.
+// Prints what is made of the programs' tables: completions, and the parts of manual pages.
 //
-// usage: command-pages bash|zsh|fish|man
+// usage: command-pages bash|zsh|fish|man bvhelperctl|brenvik-standin
 #include <cstdio>
 #include <cstring>
 #include <functional>
@@ -12,13 +12,12 @@
 #include <vector>
 
 #include "tools/bvhelperctl/CommandTable.h"
+#include "tools/support/StandInSyntax.h"
 
 namespace brenvik::tools {
 namespace {
 
 void print(const std::string& text) { std::fputs(text.c_str(), stdout); }
-
-bool isFlag(const Parameter& parameter) { return parameter.valueName == nullptr; }
 
 // In single quotes of a shell; `escape` stands for a quote inside.
 std::string quoted(const std::string& text, const char* escape) {
@@ -40,33 +39,33 @@ struct Word {
   std::string summary;
 };
 
-// What may follow "bvhelperctl", or the name of a group.
-std::vector<Word> wordsAfter(const std::string& group) {
+// What may follow the program's name, or the name of a group.
+std::vector<Word> wordsAfter(const ProgramSyntax& program, const std::string& group) {
   std::vector<Word> words;
   if (group.empty()) {
-    for (const Group& each : commandGroups()) words.push_back({each.name, each.summary});
+    for (const Group& each : *program.groups) words.push_back({each.name, each.summary});
   }
-  for (const Command& each : commandTable()) {
-    if (each.group == group) words.push_back({each.name, each.summary});
+  for (const CommandSyntax& each : program.commands) {
+    if (each.group == group && *each.name != '\0') words.push_back({each.name, each.summary});
   }
   return words;
 }
 
-std::vector<std::string> groupNames() {
+std::vector<std::string> groupNames(const ProgramSyntax& program) {
   std::vector<std::string> names;
-  for (const Group& each : commandGroups()) names.emplace_back(each.name);
+  for (const Group& each : *program.groups) names.emplace_back(each.name);
   return names;
 }
 
-std::string valuedOptions() {
+std::string valuedOptions(const ProgramSyntax& program) {
   std::set<std::string> names;
   const auto add = [&](const std::vector<Parameter>& options) {
     for (const Parameter& each : options) {
       if (!isFlag(each)) names.insert(each.name);
     }
   };
-  add(globalOptions());
-  for (const Command& each : commandTable()) add(each.options);
+  add(*program.globalOptions);
+  for (const CommandSyntax& each : program.commands) add(*each.options);
   return joined({names.begin(), names.end()});
 }
 
@@ -75,18 +74,34 @@ std::string choicesOf(const Parameter& parameter) {
 }
 
 // Every place where a value stands, as "<words>|<option or number of the positional>".
-void eachValue(const std::function<void(const std::string& place, const Parameter&)>& visit) {
-  for (const Parameter& each : globalOptions()) {
+void eachValue(const ProgramSyntax& program,
+               const std::function<void(const std::string& place, const Parameter&)>& visit) {
+  for (const Parameter& each : *program.globalOptions) {
     if (!isFlag(each)) visit("*|" + std::string(each.name), each);
   }
-  for (const Command& command : commandTable()) {
-    for (const Parameter& each : command.options) {
+  for (const CommandSyntax& command : program.commands) {
+    for (const Parameter& each : *command.options) {
       if (!isFlag(each)) visit(wordsOf(command) + "|" + each.name, each);
     }
-    for (std::size_t i = 0; i < command.positionals.size(); ++i) {
-      visit(wordsOf(command) + "|" + std::to_string(i), command.positionals[i]);
+    for (std::size_t i = 0; i < command.positionals->size(); ++i) {
+      visit(wordsOf(command) + "|" + std::to_string(i), (*command.positionals)[i]);
     }
   }
+}
+
+// The command that prints what else to offer, or nothing. `domain`: what the shell calls the word before.
+std::string askingCommand(const Parameter& parameter, const char* domain) {
+  if (parameter.offer == Offer::domains) return "bvhelperctl __complete domains 2> /dev/null";
+  if (parameter.offer == Offer::keys)
+    return std::string("bvhelperctl __complete keys ") + domain + " 2> /dev/null";
+  return "";
+}
+
+// "_brenvik_standin": what the shells call the function.
+std::string functionName(const ProgramSyntax& program) {
+  std::string name = std::string("_") + program.name;
+  for (char& c : name) c = c == '-' ? '_' : c;
+  return name;
 }
 
 // ---- bash -----------------------------------------------------------------------------------------------
@@ -98,35 +113,37 @@ constexpr const char* kWalk = R"(    if [[ " $valued " == *" $word "* ]]; then
       (( i += 1 ))
     elif [[ $word == -* ]]; then
       :
-    elif [[ -z $command ]] || [[ " $groups " == *" $command "* ]]; then
+    elif [[ -n $groups ]] && { [[ -z $command ]] || [[ " $groups " == *" $command "* ]]; }; then
       command=${command:+$command }$word
     else
       (( count += 1 ))
+      last_word=$word
     fi
 )";
 
 std::string header(const char* comment) {
-  return std::string("# Made of bvhelperctl's command table; not to be edited.\n") + comment;
+  return std::string("# Made of the program's own table; not to be edited.\n") + comment;
 }
 
-void bash() {
+void bash(const ProgramSyntax& program) {
+  const std::string function = functionName(program);
   print(
       header("# SPDX-License-"
              "Identifier: Apache-2.0\n"));
-  print("_bvhelperctl() {\n  local word command='' place='' count=0 i last=$COMP_CWORD\n");
-  print("  local current=${COMP_WORDS[COMP_CWORD]}\n  local valued=" + sh(valuedOptions()) + "\n");
-  print("  local groups=" + sh(joined(groupNames())) + "\n  COMPREPLY=()\n");
+  print(function + "() {\n  local word command='' place='' last_word='' count=0 i last=$COMP_CWORD\n");
+  print("  local current=${COMP_WORDS[COMP_CWORD]}\n  local valued=" + sh(valuedOptions(program)) + "\n");
+  print("  local groups=" + sh(joined(groupNames(program))) + "\n  COMPREPLY=()\n");
   print("  for (( i = 1; i < last; i += 1 )); do\n    word=${COMP_WORDS[i]}\n");
   print(kWalk);
   print("  done\n");
   print(R"(  if [[ -z $place && $current == -* ]]; then
     local options=)");
   std::vector<std::string> global;
-  for (const Parameter& each : globalOptions()) global.emplace_back(each.name);
+  for (const Parameter& each : *program.globalOptions) global.emplace_back(each.name);
   print(sh(joined(global)) + "\n    case $command in\n");
-  for (const Command& command : commandTable()) {
+  for (const CommandSyntax& command : program.commands) {
     std::vector<std::string> names;
-    for (const Parameter& each : command.options) names.emplace_back(each.name);
+    for (const Parameter& each : *command.options) names.emplace_back(each.name);
     if (!names.empty())
       print("      " + sh(wordsOf(command)) + ") options+=" + sh(" " + joined(names)) + " ;;\n");
   }
@@ -136,23 +153,25 @@ void bash() {
   const auto offer = [](const std::string& pattern, const std::string& offered) {
     print("    " + pattern + ") mapfile -t COMPREPLY < <(compgen " + offered + " -- \"$current\") ;;\n");
   };
-  std::vector<std::string> places = groupNames();
+  std::vector<std::string> places = groupNames(program);
   places.insert(places.begin(), "");
   for (const std::string& group : places) {
     std::vector<std::string> names;
-    for (const Word& each : wordsAfter(group)) names.push_back(each.name);
+    for (const Word& each : wordsAfter(program, group)) names.push_back(each.name);
     offer(sh(group + "|0"), "-W " + sh(joined(names)));
   }
-  eachValue([&](const std::string& place, const Parameter& parameter) {
+  eachValue(program, [&](const std::string& place, const Parameter& parameter) {
     const bool isGlobal = place.starts_with('*');
     const std::string pattern = isGlobal ? "*" + sh(place.substr(1)) : sh(place);
-    if (parameter.kind == ValueKind::choice) offer(pattern, "-W " + sh(choicesOf(parameter)));
+    const std::string asked = askingCommand(parameter, "\"$last_word\"");
+    if (!parameter.choices.empty()) offer(pattern, "-W " + sh(choicesOf(parameter)));
+    if (!asked.empty()) offer(pattern, "-W \"$(" + asked + ")\"");
     if (parameter.kind == ValueKind::path) {
       print("    " + pattern + ") compopt -o filenames 2> /dev/null; ");
       print("mapfile -t COMPREPLY < <(compgen -f -- \"$current\") ;;\n");
     }
   });
-  print("  esac\n}\ncomplete -F _bvhelperctl bvhelperctl\n");
+  print("  esac\n}\ncomplete -F " + function + " " + program.name + "\n");
 }
 
 // ---- zsh ------------------------------------------------------------------------------------------------
@@ -163,55 +182,63 @@ std::string described(const std::string& name, const std::string& summary) {
   return sh(escaped + ":" + summary);
 }
 
-void zsh() {
-  print("#compdef bvhelperctl\n" + header("# SPDX-License-"
-                                          "Identifier: Apache-2.0\n"));
-  print("_bvhelperctl() {\n  local word command='' place='' count=0 i last=$CURRENT\n");
-  print("  local current=$words[CURRENT]\n  local valued=" + sh(valuedOptions()) + "\n");
-  print("  local groups=" + sh(joined(groupNames())) + "\n  local -a offered\n");
+void zsh(const ProgramSyntax& program) {
+  const std::string function = functionName(program);
+  print(std::string("#compdef ") + program.name + "\n" +
+        header("# SPDX-License-"
+               "Identifier: Apache-2.0\n"));
+  print(function + "() {\n  local word command='' place='' last_word='' count=0 i last=$CURRENT\n");
+  print("  local current=$words[CURRENT]\n  local valued=" + sh(valuedOptions(program)) + "\n");
+  print("  local groups=" + sh(joined(groupNames(program))) + "\n  local -a offered\n");
   print("  for (( i = 2; i < last; i += 1 )); do\n    word=$words[i]\n");
   print(kWalk);
   print("  done\n  if [[ -z $place && $current == -* ]]; then\n    offered=(\n");
-  for (const Parameter& each : globalOptions()) print("      " + described(each.name, each.help) + "\n");
+  for (const Parameter& each : *program.globalOptions)
+    print("      " + described(each.name, each.help) + "\n");
   print("    )\n    case $command in\n");
-  for (const Command& command : commandTable()) {
-    if (command.options.empty()) continue;
+  for (const CommandSyntax& command : program.commands) {
+    if (command.options->empty()) continue;
     print("      " + sh(wordsOf(command)) + ") offered+=(");
-    for (const Parameter& each : command.options) print(" " + described(each.name, each.help));
+    for (const Parameter& each : *command.options) print(" " + described(each.name, each.help));
     print(" ) ;;\n");
   }
   print("    esac\n    _describe -o option offered\n    return\n  fi\n");
   print("  case \"$command|${place:-$count}\" in\n");
-  std::vector<std::string> places = groupNames();
+  std::vector<std::string> places = groupNames(program);
   places.insert(places.begin(), "");
   for (const std::string& group : places) {
     print("    " + sh(group + "|0") + ")\n      offered=(");
-    for (const Word& each : wordsAfter(group)) print(" " + described(each.name, each.summary));
+    for (const Word& each : wordsAfter(program, group)) print(" " + described(each.name, each.summary));
     print(" )\n      _describe command offered ;;\n");
   }
-  eachValue([&](const std::string& place, const Parameter& parameter) {
+  eachValue(program, [&](const std::string& place, const Parameter& parameter) {
     const std::string pattern = place.starts_with('*') ? "*" + sh(place.substr(1)) : sh(place);
-    if (parameter.kind == ValueKind::choice) {
+    const std::string asked = askingCommand(parameter, "$last_word");
+    if (!parameter.choices.empty()) {
       print("    " + pattern + ") compadd -- " + choicesOf(parameter) + " ;;\n");
+    } else if (!asked.empty()) {
+      print("    " + pattern + ") compadd -- ${(f)\"$(" + asked + ")\"} ;;\n");
     } else if (parameter.kind == ValueKind::path) {
       print("    " + pattern + ") _files ;;\n");
     } else {
       print("    " + pattern + ") _message " + sh(parameter.help) + " ;;\n");
     }
   });
-  print("  esac\n}\n_bvhelperctl \"$@\"\n");
+  print("  esac\n}\n" + function + " \"$@\"\n");
 }
 
 // ---- fish -----------------------------------------------------------------------------------------------
 
-void fishShell() {
+void fishShell(const ProgramSyntax& program) {
+  const std::string at_function = "_" + functionName(program) + "_at";
+  const std::string complete = std::string("complete -c ") + program.name;
   print(
       header("# SPDX-License-"
              "Identifier: Apache-2.0\n"));
-  print(
-      "function __bvhelperctl_at --description 'the words before the cursor are this command, and so many "
-      "more'\n");
-  print("    set -l valued " + valuedOptions() + "\n    set -l groups " + joined(groupNames()) + "\n");
+  print("function " + at_function +
+        " --description 'the words before the cursor are this command, and so many more'\n");
+  print("    set -l valued " + valuedOptions(program) + "\n    set -l groups " + joined(groupNames(program)) +
+        "\n");
   print(R"(    set -l command
     set -l count 0
     set -l skip no
@@ -222,7 +249,9 @@ void fishShell() {
             set skip yes
         else if string match -q -- '-*' $word
             continue
-        else if test -z "$command"; or contains -- "$command" $groups
+        else if test -n "$groups"; and begin
+                test -z "$command"; or contains -- "$command" $groups
+            end
             set command (string join ' ' $command $word)
         else
             set count (math $count + 1)
@@ -232,34 +261,36 @@ void fishShell() {
         test (count $argv) -lt 2; or test $count = $argv[2]
     end
 end
-complete -c bvhelperctl -f
 )");
-  const auto line = [](const std::string& condition, const std::string& rest) {
-    print("complete -c bvhelperctl" + (condition.empty() ? "" : " -n " + fish(condition)) + " " + rest +
-          "\n");
+  print(complete + " -f\n");
+  const auto line = [&](const std::string& condition, const std::string& rest) {
+    print(complete + (condition.empty() ? "" : " -n " + fish(condition)) + " " + rest + "\n");
   };
-  const auto at = [](const std::string& words, const std::string& count) {
-    return "__bvhelperctl_at \"" + words + "\"" + (count.empty() ? "" : " " + count);
+  const auto at = [&](const std::string& words, const std::string& count) {
+    return at_function + " \"" + words + "\"" + (count.empty() ? "" : " " + count);
   };
   const auto option = [&](const std::string& condition, const Parameter& each) {
     std::string rest = "-l " + std::string(each.name + 2) + " -d " + fish(each.help);
     if (!isFlag(each)) rest += each.kind == ValueKind::path ? " -r -F" : " -x";
-    if (each.kind == ValueKind::choice) rest += " -a " + fish(choicesOf(each));
+    if (!each.choices.empty()) rest += " -a " + fish(choicesOf(each));
     line(condition, rest);
   };
-  for (const Parameter& each : globalOptions()) option("", each);
-  std::vector<std::string> places = groupNames();
+  for (const Parameter& each : *program.globalOptions) option("", each);
+  std::vector<std::string> places = groupNames(program);
   places.insert(places.begin(), "");
   for (const std::string& group : places) {
-    for (const Word& each : wordsAfter(group)) {
+    for (const Word& each : wordsAfter(program, group)) {
       line(at(group, "0"), "-a " + fish(each.name) + " -d " + fish(each.summary));
     }
   }
-  for (const Command& command : commandTable()) {
-    for (const Parameter& each : command.options) option(at(wordsOf(command), ""), each);
-    for (std::size_t i = 0; i < command.positionals.size(); ++i) {
-      const Parameter& each = command.positionals[i];
-      if (each.kind == ValueKind::choice) {
+  for (const CommandSyntax& command : program.commands) {
+    for (const Parameter& each : *command.options) option(at(wordsOf(command), ""), each);
+    for (std::size_t i = 0; i < command.positionals->size(); ++i) {
+      const Parameter& each = (*command.positionals)[i];
+      const std::string asked = askingCommand(each, "(commandline -opc)[-1]");
+      if (!asked.empty()) {
+        line(at(wordsOf(command), std::to_string(i)), "-a " + fish("(" + asked + ")"));
+      } else if (!each.choices.empty()) {
         line(at(wordsOf(command), std::to_string(i)), "-a " + fish(choicesOf(each)));
       } else if (each.kind == ValueKind::path) {
         line(at(wordsOf(command), std::to_string(i)), "-F");
@@ -289,7 +320,8 @@ void manualOption(const Parameter& each) {
 void manualCommand(const Command& command) {
   print("*" + scd(wordsOf(command)) + "*");
   for (const Parameter& each : command.options) {
-    print(" [" + scd(each.name) + " _" + scd(each.valueName) + "_]" + (each.isRepeatable ? "..." : ""));
+    print(" [" + scd(each.name) + (isFlag(each) ? "" : " _" + scd(each.valueName) + "_") + "]" +
+          (each.isRepeatable ? "..." : ""));
   }
   for (const Parameter& each : command.positionals) print(" _" + scd(each.name) + "_");
   std::string summary = command.summary;
@@ -326,22 +358,51 @@ void manual() {
   }
 }
 
+// The program's options, for a page that has no commands.
+void manualOfOptions(const ProgramSyntax& program) {
+  for (const Parameter& each : *program.globalOptions) {
+    print("*" + scd(each.name) + "*" + (isFlag(each) ? "" : " _" + scd(each.valueName) + "_") + "\n\t");
+    std::string help = each.help;
+    help.front() = static_cast<char>(std::toupper(static_cast<unsigned char>(help.front())));
+    print(scd(help) + ".\n\n");
+  }
+}
+
+void manualOfExitStatuses(bool asksHelper) {
+  print("# EXIT STATUS\n\n");
+  for (const ExitStatusFacts& each : kExitStatuses) {
+    if (each.isOfRequest && !asksHelper) continue;
+    print("*" + std::to_string(static_cast<int>(each.status)) + "*\n\t" + scd(each.meaning) + "\n\n");
+  }
+}
+
 }  // namespace
 }  // namespace brenvik::tools
 
 int main(int argc, char** argv) {
   using namespace brenvik::tools;
-  const std::string what = argc == 2 ? argv[1] : "";
+  const std::string what = argc == 3 ? argv[1] : "";
+  const std::string which = argc == 3 ? argv[2] : "";
+  const bool isStandIn = which == kStandInName;
+  const ProgramSyntax program = isStandIn ? standInSyntax() : programSyntax();
+  if (which != program.name) {
+    std::fprintf(stderr, "usage: command-pages bash|zsh|fish|man bvhelperctl|brenvik-standin\n");
+    return 2;
+  }
   if (what == "bash") {
-    bash();
+    bash(program);
   } else if (what == "zsh") {
-    zsh();
+    zsh(program);
   } else if (what == "fish") {
-    fishShell();
+    fishShell(program);
   } else if (what == "man") {
-    manual();
+    if (isStandIn) {
+      manualOfOptions(program);
+    } else {
+      manual();
+    }
+    manualOfExitStatuses(program.asksHelper);
   } else {
-    std::fprintf(stderr, "usage: command-pages bash|zsh|fish|man\n");
     return 2;
   }
   return std::fflush(stdout) == 0 ? 0 : 1;

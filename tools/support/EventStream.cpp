@@ -5,25 +5,22 @@
 #include <poll.h>
 #include <sys/signalfd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <cstring>
-#include <memory>
 #include <nlohmann/json.hpp>
 #include <span>
 
-#include "platform/base/UniqueFd.h"
 #include "platform/plist/PropertyListCodec.h"
+#include "tools/support/Output.h"
 #include "tools/support/PropertyListText.h"
 
 namespace brenvik::tools {
 namespace {
-
-struct FreeListener {
-  void operator()(bvmh_listener* listener) const { bvmh_listener_free(listener); }
-};
 
 // Interrupts as input, so that the socket files are removed on the way out.
 UniqueFd endingSignals() {
@@ -50,21 +47,77 @@ const char* nameOf(bvmh_event_kind kind) {
 }
 
 // Answers a push as the options say, and tells what became of that.
-std::string answer(bvmh_listener* listener, const bvmh_event& event, const EventStreamOptions& options) {
+std::string answer(StandIn& standIn, const bvmh_event& event, const EventStreamOptions& options) {
   if (!event.wants_reply || !options.answers) return "none";
-  if (bvmh_listener_reply(listener, &event, 0, options.errorCode) != BVMH_OK)
-    return "none, the sender has gone";
+  if (!standIn.answer(event, options.errorCode)) return "none, the sender has gone";
   return options.errorCode == 0 ? "success" : "refused with " + std::to_string(options.errorCode);
 }
 
-int cannotListen(const EventStreamOptions& options, std::int32_t code, int error) {
-  const std::string reason = code == BVMH_ERROR_SYSTEM ? std::strerror(error) : bvmh_error_text(code);
-  std::fprintf(stderr, "%s: cannot listen in %s: %s\n", options.program.c_str(), options.directory.c_str(),
-               reason.c_str());
-  return 2;
+ExitStatus cannotListen(const EventStreamOptions& options, const StandIn& standIn) {
+  printFailure(options.program, options.asJson,
+               "cannot listen " + standIn.place() + ": " + standIn.reason(), "",
+               nlohmann::ordered_json::object());
+  return ExitStatus::failed;
 }
 
 }  // namespace
+
+Patience::Patience(std::optional<double> seconds) {
+  if (seconds) end_ = Clock::now() + std::chrono::milliseconds(static_cast<std::int64_t>(*seconds * 1000));
+}
+
+int Patience::milliseconds(int most) const {
+  if (!end_) return -1;
+  // Rounded up, so that the time is over when poll returns.
+  const auto left = std::chrono::ceil<std::chrono::milliseconds>(*end_ - Clock::now()).count();
+  return static_cast<int>(std::clamp<std::int64_t>(left, 0, most));
+}
+
+StandIn::~StandIn() { bvmh_listener_free(listener_); }
+
+bool StandIn::fail(std::int32_t code, int error) {
+  reason_ = code == BVMH_ERROR_SYSTEM ? std::strerror(error) : bvmh_error_text(code);
+  return false;
+}
+
+bool StandIn::listen(const std::string& directory, unsigned services,
+                     std::optional<std::uint32_t> helperUid) {
+  const std::string folder = directory.empty() ? bvmh_bootstrap_directory() : directory;
+  place_ = "in " + printable(folder);
+  signals_ = endingSignals();
+  if (!signals_.isValid()) return fail(BVMH_ERROR_SYSTEM, errno);
+  // Sockets that a service manager handed over come first, unless a folder was asked for.
+  std::int32_t created = BVMH_ERROR_NOT_HANDED_OVER;
+  if (directory.empty()) created = bvmh_listener_create_from_environment(services, &listener_);
+  if (created == BVMH_ERROR_NOT_HANDED_OVER) {
+    created = bvmh_listener_create(folder.c_str(), services, &listener_);
+  } else {
+    place_ = "on the sockets of the service manager";
+  }
+  if (created != BVMH_OK) return fail(created, errno);
+  if (helperUid) bvmh_listener_allow_uid(listener_, *helperUid);
+  return true;
+}
+
+bool StandIn::answer(const bvmh_event& event, std::int32_t errorCode) {
+  return bvmh_listener_reply(listener_, &event, 0, errorCode) == BVMH_OK;
+}
+
+StandIn::Came StandIn::next(int milliseconds, bvmh_event* event) {
+  std::array inputs{pollfd{bvmh_listener_fd(listener_), POLLIN, 0}, pollfd{signals_.get(), POLLIN, 0}};
+  const int ready = ::poll(inputs.data(), inputs.size(), milliseconds);
+  if (ready < 0 && errno != EINTR) {
+    (void)fail(BVMH_ERROR_SYSTEM, errno);
+    return Came::failure;
+  }
+  if (inputs[1].revents != 0) return Came::interrupt;
+  if (ready <= 0) return Came::nothing;
+  const std::int32_t code = bvmh_listener_next(listener_, 0, event);
+  if (code == BVMH_OK) return Came::event;
+  if (code == BVMH_ERROR_TIMED_OUT) return Came::nothing;
+  (void)fail(code, bvmh_listener_errno(listener_));
+  return Came::failure;
+}
 
 std::string eventLine(const bvmh_event& event, const std::string& answer, bool asJson) {
   const PropertyList values =
@@ -98,47 +151,48 @@ std::string eventLine(const bvmh_event& event, const std::string& answer, bool a
   return line;
 }
 
-int printEvents(const EventStreamOptions& given) {
-  EventStreamOptions options = given;
-  const UniqueFd signals = endingSignals();
-  if (!signals.isValid()) return cannotListen(options, BVMH_ERROR_SYSTEM, errno);
-
-  constexpr unsigned kBoth = BVMH_PUSHES | BVMH_NOTIFICATIONS;
-  bvmh_listener* made = nullptr;
-  // Sockets that a service manager handed over come first, unless a folder was asked for.
-  std::int32_t created = BVMH_ERROR_NOT_HANDED_OVER;
-  if (options.directory.empty()) {
-    created = bvmh_listener_create_from_environment(kBoth, &made);
-    options.directory = created == BVMH_ERROR_NOT_HANDED_OVER ? bvmh_bootstrap_directory()
-                                                              : "the sockets of the service manager";
+void printFailure(const std::string& program, bool asJson, const std::string& message,
+                  const std::string& advice, const nlohmann::ordered_json& fields) {
+  if (asJson) {
+    nlohmann::ordered_json line{{"ok", false}};
+    line.update(fields);
+    line["error"] = message;
+    if (!advice.empty()) line["advice"] = advice;
+    (void)printOut(jsonLine(line) + '\n');  // a loss is told at the end
+    return;
   }
-  const bool isHandedOver = created != BVMH_ERROR_NOT_HANDED_OVER;
-  if (!isHandedOver) {
-    created = bvmh_listener_create(options.directory.c_str(), kBoth, &made);
-  }
-  const std::unique_ptr<bvmh_listener, FreeListener> listener(made);
-  if (created != BVMH_OK) return cannotListen(options, created, errno);
-  if (options.helperUid) bvmh_listener_allow_uid(listener.get(), *options.helperUid);
-  std::fprintf(stderr, "%s: listening %s %s\n", options.program.c_str(), isHandedOver ? "on" : "in",
-               options.directory.c_str());
+  std::fprintf(stderr, "%s %s\n", styled(Look::bad, program + ":", Stream::error).c_str(), message.c_str());
+  if (!advice.empty()) std::fprintf(stderr, "%s\n", advice.c_str());
+}
 
+ExitStatus printEvents(const EventStreamOptions& options) {
+  StandIn standIn;
+  if (!standIn.listen(options.directory, BVMH_PUSHES | BVMH_NOTIFICATIONS, options.helperUid)) {
+    return cannotListen(options, standIn);
+  }
+  std::fprintf(stderr, "%s: listening %s\n", options.program.c_str(), standIn.place().c_str());
+
+  const Patience patience(options.seconds);
   for (std::uint64_t count = 0; !options.most || count < *options.most;) {
-    std::array inputs{pollfd{bvmh_listener_fd(listener.get()), POLLIN, 0}, pollfd{signals.get(), POLLIN, 0}};
-    if (::poll(inputs.data(), inputs.size(), -1) < 0 && errno != EINTR) {
-      return cannotListen(options, BVMH_ERROR_SYSTEM, errno);
-    }
-    if (inputs[1].revents != 0) break;
     bvmh_event event{};
-    const std::int32_t code = bvmh_listener_next(listener.get(), 0, &event);
-    if (code == BVMH_ERROR_TIMED_OUT) continue;
-    if (code != BVMH_OK) return cannotListen(options, code, bvmh_listener_errno(listener.get()));
+    const StandIn::Came came = standIn.next(patience.milliseconds(), &event);
+    if (came == StandIn::Came::interrupt) break;
+    if (came == StandIn::Came::failure) return cannotListen(options, standIn);
+    if (came == StandIn::Came::nothing) {
+      if (!patience.isOver()) continue;
+      if (!options.most) break;
+      printFailure(options.program, options.asJson,
+                   std::to_string(count) + " of " + std::to_string(*options.most) + " arrived in time", "",
+                   nlohmann::ordered_json::object());
+      return ExitStatus::timedOut;
+    }
     ++count;
-    const std::string answered = answer(listener.get(), event, options);
-    std::printf("%s\n", eventLine(event, answered, options.asJson).c_str());
-    std::fflush(stdout);
+    const std::string answered = answer(standIn, event, options);
+    const bool isPrinted = printOut(eventLine(event, answered, options.asJson) + '\n') && flushOutput();
     bvmh_event_free(&event);
+    if (!isPrinted) break;  // nobody reads any more; finishOutput says so
   }
-  return 0;
+  return ExitStatus::done;
 }
 
 }  // namespace brenvik::tools

@@ -10,6 +10,8 @@
 #include <cstdio>
 #include <ctime>
 #include <nlohmann/json.hpp>
+#include <span>
+#include <utility>
 
 #include "platform/base/Utf8.h"
 #include "tools/support/Base64.h"
@@ -19,13 +21,17 @@ namespace {
 
 constexpr std::size_t kShownBytes = 16;
 
-std::string isoDate(double secondsSince2001) {
-  constexpr double kUnixTimeOf2001 = 978307200;
+constexpr double kUnixTimeOf2001 = 978307200;
+
+// Years 0 to 9999, which is what the text has digits for.
+bool hasIsoDate(double secondsSince2001) {
   const double unixTime = std::floor(secondsSince2001) + kUnixTimeOf2001;
-  // Years 0 to 9999, which is what the text has digits for.
-  if (!(unixTime >= -62167219200.0 && unixTime < 253402300800.0)) {
-    return std::to_string(secondsSince2001) + " s since 2001";
-  }
+  return unixTime >= -62167219200.0 && unixTime < 253402300800.0;
+}
+
+std::string isoDate(double secondsSince2001) {
+  if (!hasIsoDate(secondsSince2001)) return std::to_string(secondsSince2001) + " s since 2001";
+  const double unixTime = std::floor(secondsSince2001) + kUnixTimeOf2001;
   const auto seconds = static_cast<std::time_t>(unixTime);
   std::tm parts{};
   ::gmtime_r(&seconds, &parts);
@@ -81,6 +87,12 @@ std::string scalarText(const PropertyList& value) {
       return "{}";
   }
   return "";
+}
+
+// The key of an object that stands for something JSON has not.
+bool isMark(std::string_view key) {
+  return key == "base64" || key == "date" || key == "secondsSince2001" || key == "real" ||
+         key == "dictionary";
 }
 
 bool isFullContainer(const PropertyList& value) { return value.size() != 0; }
@@ -146,13 +158,15 @@ nlohmann::ordered_json jsonOf(const PropertyList& value) {
     case PropertyList::Type::integer:
       return value.asInteger() ? Json(*value.asInteger()) : Json(value.asUnsignedInteger().value_or(0));
     case PropertyList::Type::real:
-      return std::isfinite(*value.asReal()) ? Json(*value.asReal()) : Json(realText(*value.asReal()));
+      return std::isfinite(*value.asReal()) ? Json(*value.asReal())
+                                            : Json{{"real", realText(*value.asReal())}};
     case PropertyList::Type::string:
       return *value.asString();
     case PropertyList::Type::data:
       return Json{{"base64", toBase64(*value.asData())}};
     case PropertyList::Type::date:
-      return isoDate(*value.asDate());
+      return hasIsoDate(*value.asDate()) ? Json{{"date", isoDate(*value.asDate())}}
+                                         : Json{{"secondsSince2001", realText(*value.asDate())}};
     case PropertyList::Type::array: {
       Json array = Json::array();
       for (std::size_t i = 0; i < value.size(); ++i) array.push_back(jsonOf(value.at(i)));
@@ -165,10 +179,16 @@ nlohmann::ordered_json jsonOf(const PropertyList& value) {
       for (std::size_t i = 0; i < value.size(); ++i) {
         entries.Json::object_t::Container::emplace_back(std::string(value.keyAt(i)), jsonOf(value.at(i)));
       }
+      if (value.size() == 1 && isMark(value.keyAt(0))) return Json{{"dictionary", std::move(object)}};
       return object;
     }
   }
   return nullptr;
+}
+
+nlohmann::ordered_json jsonOfText(std::string_view text) {
+  if (isValidUtf8(text)) return text;
+  return {{"base64", toBase64(std::as_bytes(std::span(text)))}};
 }
 
 std::string jsonLine(const nlohmann::ordered_json& value) {

@@ -88,10 +88,31 @@ TEST(PropertyListTextTest, KeepsTheOrderAndTheTypesInJson) {
   EXPECT_EQ(
       jsonLine(jsonOf(example())),
       R"({"Name":"Norvale\nMobil\u001b[31m","Version":-7,"Huge":18446744073709551615,"Ratio":0.25,"On":true,)"
-      R"("When":"2000-12-31T23:59:59.500Z","Icon":{"base64":"Zm9vYg=="},"Empty":{},"None":[],)"
+      R"("When":{"date":"2000-12-31T23:59:59.500Z"},"Icon":{"base64":"Zm9vYg=="},"Empty":{},"None":[],)"
       R"("List":["a",{"k":"v"}]})");
   EXPECT_EQ(jsonLine(jsonOf(PropertyList())), "null");
-  EXPECT_EQ(jsonLine(jsonOf(PropertyList::real(std::numeric_limits<double>::infinity()))), "\"inf\"");
+  EXPECT_EQ(jsonLine(jsonOf(PropertyList::real(std::numeric_limits<double>::infinity()))),
+            R"({"real":"inf"})");
+}
+
+TEST(PropertyListTextTest, WhatJsonHasNotIsTakenForNothingElse) {
+  const auto shown = [](const PropertyList& value) { return jsonLine(jsonOf(value)); };
+  EXPECT_EQ(shown(PropertyList::string("nan")), "\"nan\"");
+  EXPECT_EQ(shown(PropertyList::real(std::numeric_limits<double>::quiet_NaN())), R"({"real":"nan"})");
+  EXPECT_EQ(shown(PropertyList::real(1)), "1.0");
+  EXPECT_EQ(shown(PropertyList::date(1e300)), R"({"secondsSince2001":"1e+300"})");
+  EXPECT_EQ(shown(PropertyList::date(253402300800.0 - 978307200.0 - 1)),
+            R"({"date":"9999-12-31T23:59:59Z"})");
+  for (const char* key : {"base64", "date", "secondsSince2001", "real", "dictionary"}) {
+    const std::string plain = "{\"" + std::string(key) + "\":\"x\"}";
+    EXPECT_EQ(shown(PropertyList::dictionary({{key, PropertyList::string("x")}})),
+              "{\"dictionary\":" + plain + "}");
+  }
+  EXPECT_EQ(
+      shown(PropertyList::dictionary({{"date", PropertyList::string("x")}, {"k", PropertyList::integer(1)}})),
+      R"({"date":"x","k":1})");
+  EXPECT_EQ(jsonLine(jsonOfText("K\xC3\xB6ln")), "\"K\xC3\xB6ln\"");
+  EXPECT_EQ(jsonLine(jsonOfText("\xFF")), R"({"base64":"/w=="})");
 }
 
 TEST(PropertyListTextTest, NothingOnATerminalCanSteerIt) {
