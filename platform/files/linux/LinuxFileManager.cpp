@@ -435,17 +435,8 @@ FileOutcome LinuxFileManager::setAttributes(const std::string& path,
                                             const ItemAttributes& attributes) noexcept {
   return guarded([&] {
     // Of the item itself, and both of the same one: whoever owns the directory may put another in its place.
-    Place place;
     UniqueFd item;
-    const int error = Place::open(path, &place);
-    if (error == 0) {
-      item.reset(::openat(place.directory.get(), place.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-      if (!item.isValid()) return errno;
-    } else if (error != EEXIST) {
-      return error;
-    } else if (const int failed = openDirectory(path, &item); failed != 0) {
-      return failed;
-    }
+    if (const int error = openItem(path, &item); error != 0) return error;
     if (attributes.uid || attributes.gid) {
       const uid_t uid = attributes.uid.value_or(static_cast<uid_t>(-1));
       const gid_t gid = attributes.gid.value_or(static_cast<gid_t>(-1));

@@ -85,6 +85,18 @@ bool isEntry(int directory, const char* name, int item) {
 
 bool isOwn(const struct stat& info) { return info.st_uid == ::geteuid(); }
 
+// A descriptor of O_PATH, or -1.
+int openWithoutLinks(const char* path, int flags) {
+  open_how how{};
+  how.flags = static_cast<unsigned>(O_PATH | O_CLOEXEC | flags);
+  how.resolve = RESOLVE_NO_SYMLINKS;
+  return static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, path, &how, sizeof how));
+}
+
+// ELOOP: there is a link on the way. ENOSYS: a service manager's filter, which cannot look into the
+// arguments.
+bool mayHaveLinks(int error) { return error == ELOOP || error == ENOSYS; }
+
 // Whether nobody but root and this account can have made the link, or can replace it.
 bool isTrusted(int directory, const struct stat& link) {
   struct stat info {};
@@ -168,15 +180,22 @@ int renameOver(int directory, const char* from, const char* to) {
 
 }  // namespace
 
+int openItem(const std::string& path, UniqueFd* item) {
+  // Nothing is allocated where no link is on the way: an item just made is given away although memory is
+  // lacking.
+  item->reset(openWithoutLinks(path.c_str(), O_NOFOLLOW));
+  if (item->isValid() || !mayHaveLinks(errno)) return item->isValid() ? 0 : errno;
+  Place place;
+  const int error = Place::open(path, &place);
+  if (error != 0) return error == EEXIST ? openDirectory(path, item) : error;
+  item->reset(::openat(place.directory.get(), place.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  return item->isValid() ? 0 : errno;
+}
+
 int openDirectory(const std::string& path, UniqueFd* directory) {
   if (path.empty()) return ENOENT;
-  open_how how{};
-  how.flags = O_PATH | O_DIRECTORY | O_CLOEXEC;
-  how.resolve = RESOLVE_NO_SYMLINKS;
-  directory->reset(static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how)));
-  // ELOOP: there is a link on the way. ENOSYS: a service manager's filter, which cannot look into the
-  // arguments.
-  if (directory->isValid() || (errno != ELOOP && errno != ENOSYS)) return directory->isValid() ? 0 : errno;
+  directory->reset(openWithoutLinks(path.c_str(), O_DIRECTORY));
+  if (directory->isValid() || !mayHaveLinks(errno)) return directory->isValid() ? 0 : errno;
 
   std::string rest = path;
   int links = 0;

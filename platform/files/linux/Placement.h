@@ -17,6 +17,10 @@ namespace brenvik {
 // anywhere. 0 or errno; ENOENT for such a link, as if the directory were missing. May throw std::bad_alloc.
 int openDirectory(const std::string& path, UniqueFd* directory);
 
+// Opens whatever is at the path (O_PATH): a link itself, and by the same way. 0 or errno. May throw
+// std::bad_alloc.
+int openItem(const std::string& path, UniqueFd* item);
+
 // The directory an item is to stand in, opened, and the item's name there.
 struct Place {
   UniqueFd directory;
