@@ -738,6 +738,10 @@ class CheckIn(AllocationsTest):
 
     def sweep_check_in(self, account, right, name):
         self.start_closing_thread()
+        # The account's refusals are counted from its first one on.
+        harness.entitle(value=False)
+        self.assertEqual(self.check_in(account), 35)
+        harness.entitle()
         quiet = Quiet(self)
         # Closed without an answer: the client tries again. 35: what might say no could not be read.
         def send(_):
