@@ -733,7 +733,19 @@ class CheckIn(AllocationsTest):
                 return 254
         return harness.as_account(account or "root", work)
 
+    def start_closing_thread(self):
+        """It starts with the first connection that is given up with a message unread, and stays."""
+        connection = wire.connect()
+        connection.status(wire.header(1, 24), [0, 0])
+        connection.close()
+        harness.eventually(lambda: "closing" in self.daemon.threads(), what="the thread")
+
     def sweep_check_in(self, account, right, name):
+        self.start_closing_thread()
+        # The account's refusals are counted from its first one on.
+        harness.entitle(value=False)
+        self.assertEqual(self.check_in(account), 35)
+        harness.entitle()
         quiet = Quiet(self)
         # Closed without an answer: the client tries again. 35: what might say no could not be read.
         def send(_):

@@ -108,6 +108,7 @@ bool ClosingLine::State::push(Job&& job) noexcept {
   if (stopping || jobs.size() >= kCapacity) return false;
   try {
     busy.reserve(kMostThreads);
+    if (job.token != 0) discarded.reserve(kCapacity + kMostThreads);  // telling must not fail
     jobs.push_back(std::move(job));
   } catch (const std::bad_alloc&) {
     return false;

@@ -646,11 +646,16 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   void tick() {
     const auto self = std::move(tick_);  // the handler that runs
     if (std::exchange(hasLimited_, false)) {
-      std::vector<std::shared_ptr<Channel>> waiting;
-      for (const auto& [raw, channel] : channels_) {
-        if (channel->isLimited()) waiting.push_back(channel);
+      // One after the other, without memory: resuming may end the channel, and then its entry goes.
+      for (auto entry = channels_.begin(); entry != channels_.end();) {
+        if (!entry->second->isLimited()) {
+          ++entry;
+          continue;
+        }
+        const std::shared_ptr<Channel> channel = entry->second;
+        channel->resume();
+        entry = channels_.begin();
       }
-      for (const auto& channel : waiting) channel->resume();
     }
     if (std::exchange(isAcceptingPaused_, false)) {
       (void)source_->setEvents(EPOLLIN);

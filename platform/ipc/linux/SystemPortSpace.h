@@ -62,7 +62,8 @@ class SystemPortSpace final : public PortSpace {
 
   PortName unusedName() noexcept;
   Port* insert(PortName* name) noexcept;
-  SharedFd shareForeign(UniqueFd descriptor, Account account);
+  SharedFd shareRight(UniqueFd socket, Account account);
+  SharedFd shareListening(UniqueFd socket);
   std::weak_ptr<ClosingLine> weakLine() const noexcept { return closing_; }
   void eraseIfUnused(PortName name) noexcept;
 

@@ -775,6 +775,21 @@ TEST_F(PortsTest, APortThatDiedBeforeItWasWatchedIsToldAfterTheCallbackIsSetAndA
   EXPECT_EQ(told, 1);
 }
 
+TEST_F(PortsTest, DeathIsToldWhereTheSameRightWasGivenTwiceAndRefusedOnce) {
+  auto [theirs, ours] = pair();
+  UniqueFd again(::fcntl(ours.get(), F_DUPFD_CLOEXEC, 0));
+  const auto watch = sources.makeDeathWatch(ports.adoptSendRight(std::move(ours)), *loop, nullptr);
+  ASSERT_EQ(ports.deallocateSendRight(ports.adoptSendRight(std::move(again))), kern::success);
+  int told = 0;
+  watch->setInvalidationCallback([&](DeathWatch&) { ++told; });
+  pump();
+  EXPECT_TRUE(watch->isValid());
+  EXPECT_EQ(told, 0);
+  theirs.reset();
+  pump();
+  EXPECT_EQ(told, 1);
+}
+
 TEST_F(PortsTest, AnInvalidatedWatchTellsNothing) {
   auto [theirs, ours] = pair();
   const auto watch = sources.makeDeathWatch(ports.adoptSendRight(std::move(ours)), *loop, nullptr);
