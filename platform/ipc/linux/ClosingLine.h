@@ -15,7 +15,7 @@ namespace brenvik {
 
 // Closes descriptors that somebody else made, on threads of its own: the last close of a socket that lingers,
 // or of a file of a user's own file system, waits for as long as its maker likes (see
-// docs/decisions/door.md).
+// docs/decisions/11-door.md).
 //
 // A close that waits is interrupted every 100 ms, which ends a lingering. A file system that does not answer
 // keeps its thread; no account keeps more than one, and an account that keeps one only delays what is its
