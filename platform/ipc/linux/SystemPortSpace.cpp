@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/ipc/linux/SystemPortSpace.h"
 
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -26,6 +27,12 @@ bool isDrained(int socket) noexcept {
   return size == 0 && message.msg_flags == 0 && message.msg_controllen == 0;
 }
 
+// Whether nothing can be put into the socket any more: its other end is gone, or either end has been shut.
+bool canReceiveNothingMore(int socket) noexcept {
+  pollfd state{socket, POLLRDHUP, 0};
+  return ::poll(&state, 1, 0) == 1 && (state.revents & (POLLHUP | POLLRDHUP)) != 0;
+}
+
 // Without a line it is closed here: the process ends, or this is the line's own thread.
 void closeIn(const std::weak_ptr<ClosingLine>& line, UniqueFd descriptor, ClosingLine::Account account) {
   if (const auto alive = line.lock()) alive->close(std::move(descriptor), account);
@@ -42,21 +49,13 @@ SystemPortSpace::SharedFd SystemPortSpace::share(UniqueFd socket, Account accoun
   });
 }
 
-SystemPortSpace::SharedFd SystemPortSpace::shareRight(UniqueFd socket, Account account) {
+SystemPortSpace::SharedFd SystemPortSpace::shareForeign(UniqueFd socket, Account account) {
   return SharedFd(new UniqueFd(std::move(socket)), [line = weakLine(), account](const UniqueFd* given) {
     const std::unique_ptr<UniqueFd> owned(const_cast<UniqueFd*>(given));
-    // Its sender may still hold it, but nothing is put into it from here on. A hang-up is told to its other
-    // holders as before: that takes both directions.
-    (void)::shutdown(owned->get(), SHUT_RD);
-    if (!isDrained(owned->get())) closeIn(line, std::move(*owned), account);
-  });
-}
-
-SystemPortSpace::SharedFd SystemPortSpace::shareListening(UniqueFd socket) {
-  return SharedFd(new UniqueFd(std::move(socket)), [line = weakLine()](const UniqueFd* given) {
-    const std::unique_ptr<UniqueFd> owned(const_cast<UniqueFd*>(given));
-    // The service manager listens at it, too: it is not shut. Closing it may drop what nobody has accepted.
-    closeIn(line, std::move(*owned), ClosingLine::kClients);
+    // Others may still use the same socket, so it is not shut. In most cases the other end is gone.
+    if (!canReceiveNothingMore(owned->get()) || !isDrained(owned->get())) {
+      closeIn(line, std::move(*owned), account);
+    }
   });
 }
 
@@ -156,7 +155,8 @@ KernelReturn SystemPortSpace::deallocateSendRight(PortName name) noexcept {
 
 PortName SystemPortSpace::adoptService(UniqueFd listening, std::string socketFile) noexcept {
   try {
-    auto shared = shareListening(std::move(listening));
+    // Closing it drops what was sent over connections that nobody has accepted.
+    auto shared = shareForeign(std::move(listening), ClosingLine::kClients);
     PortName name = kNullPort;
     Port* const port = insert(&name);
     if (port == nullptr) return kNullPort;
@@ -174,7 +174,7 @@ PortName SystemPortSpace::adoptService(UniqueFd listening, std::string socketFil
 
 PortName SystemPortSpace::adoptSendRight(UniqueFd end, Account account) noexcept {
   try {
-    auto shared = shareRight(std::move(end), account);
+    auto shared = shareForeign(std::move(end), account);
     PortName name = kNullPort;
     Port* const port = insert(&name);
     if (port == nullptr) return kNullPort;

@@ -62,8 +62,7 @@ class SystemPortSpace final : public PortSpace {
 
   PortName unusedName() noexcept;
   Port* insert(PortName* name) noexcept;
-  SharedFd shareRight(UniqueFd socket, Account account);
-  SharedFd shareListening(UniqueFd socket);
+  SharedFd shareForeign(UniqueFd socket, Account account);
   std::weak_ptr<ClosingLine> weakLine() const noexcept { return closing_; }
   void eraseIfUnused(PortName name) noexcept;
 

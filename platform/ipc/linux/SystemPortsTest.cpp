@@ -790,6 +790,18 @@ TEST_F(PortsTest, DeathIsToldWhereTheSameRightWasGivenTwiceAndRefusedOnce) {
   EXPECT_EQ(told, 1);
 }
 
+TEST_F(PortsTest, ARightThatIsGivenUpStaysOpenForOthersWhoHoldTheSameSocket) {
+  auto [theirs, ours] = pair();
+  const UniqueFd kept(::fcntl(ours.get(), F_DUPFD_CLOEXEC, 0));
+  ASSERT_EQ(ports.deallocateSendRight(ports.adoptSendRight(std::move(ours))), kern::success);
+  ports.closing().drain();
+  ASSERT_EQ(::send(theirs.get(), "a", 1, MSG_NOSIGNAL), 1);
+  char letter = 0;
+  EXPECT_EQ(::recv(kept.get(), &letter, 1, MSG_DONTWAIT), 1);
+  ASSERT_EQ(::send(kept.get(), "b", 1, MSG_NOSIGNAL), 1);
+  EXPECT_EQ(::recv(theirs.get(), &letter, 1, MSG_DONTWAIT), 1);
+}
+
 TEST_F(PortsTest, AnInvalidatedWatchTellsNothing) {
   auto [theirs, ours] = pair();
   const auto watch = sources.makeDeathWatch(ports.adoptSendRight(std::move(ours)), *loop, nullptr);
