@@ -113,6 +113,13 @@ class AllocationsTest(HelperTest):
         self.assertEqual(self.caller.status("RemoveCarrierFile", long("/nowhere"), long("no domain")), 8)
         self.maps = self.daemon.maps()
 
+    def start_closing_thread(self):
+        """It starts with the first descriptor of somebody else's that is dropped, and stays."""
+        connection = wire.connect()
+        connection.status(wire.header(1, 24), [0, 0])
+        connection.close()
+        harness.eventually(lambda: "closing" in self.daemon.threads(), what="the thread")
+
     def problem(self, what):
         self.problems.append(what)
         print(what, file=sys.stderr, flush=True)
@@ -317,6 +324,7 @@ class Preferences(AllocationsTest):
         self.sweep(Request(self.set(b"\0"), done, self.stored("old"), self.state, failures=(3, 5, 6)), "remove")
 
     def test_set_large(self):
+        self.start_closing_thread()  # where the value's memory goes when the request is refused
         value = os.urandom(100_000)
         self.sweep(Request(self.set(plistlib.dumps(value, fmt=plistlib.FMT_BINARY), "memfd"), done, self.stored("old"),
                            self.state, failures=(3, 5, 6)), "set large")
@@ -732,13 +740,6 @@ class CheckIn(AllocationsTest):
             except (wire.Closed, BrokenPipeError):
                 return 254
         return harness.as_account(account or "root", work)
-
-    def start_closing_thread(self):
-        """It starts with the first connection that is given up with a message unread, and stays."""
-        connection = wire.connect()
-        connection.status(wire.header(1, 24), [0, 0])
-        connection.close()
-        harness.eventually(lambda: "closing" in self.daemon.threads(), what="the thread")
 
     def sweep_check_in(self, account, right, name):
         self.start_closing_thread()

@@ -32,9 +32,9 @@ class Brenvikd:
         account = pwd.getpwnam("telephony")
         groups = [each.gr_gid for each in grp.getgrall() if each.gr_name == "brenvik"]
         shuffle = " ".join(f"{3 + i}<&{sock.fileno()}" for i, sock in enumerate(self.sockets))
-        # LISTEN_PID must be its own, so a shell sets it and becomes the daemon.
+        # LISTEN_PID must be its own, so a shell sets it and becomes the daemon; bash, since descriptors may have two digits.
         self.process = subprocess.Popen(
-            ["/bin/sh", "-c", f'exec {shuffle}; LISTEN_PID=$$ exec "$@"', "sh", str(PROGRAM)],
+            ["/bin/bash", "-c", f'exec {shuffle}; LISTEN_PID=$$ exec "$@"', "bash", str(PROGRAM)],
             env={"LISTEN_FDS": str(len(names)), "LISTEN_FDNAMES": ":".join(names)}, text=True,
             stdout=subprocess.PIPE, stderr=subprocess.PIPE, pass_fds=[sock.fileno() for sock in self.sockets],
             user=account.pw_uid, group=account.pw_gid, extra_groups=groups)
