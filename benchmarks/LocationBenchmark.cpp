@@ -39,7 +39,7 @@ constexpr std::int32_t kCivicInfo = 3;
 constexpr std::int32_t kOneUnifiedLine = 4;
 constexpr std::int32_t kOneBsdLine = 5;
 constexpr double kMostOfAnEmptyRequest = 1.1;
-constexpr double kMostOfALookUp = 1000;  // microseconds, for 99 of 100
+constexpr double kMostOfALookUp = 100;  // microseconds, for 99 of 100
 
 class GeoServiceNeverAnswers final : public GeoService {
  public:
@@ -170,9 +170,17 @@ bool measureLookUps(const char* path, int count) {
     std::exit(2);
   }
   std::vector<Coordinate> places;
-  Query all(*sqlite(), handle, "select min_lat, min_lng from place_at");
+  Query all(*sqlite(), handle, "select cell, data from near");
   while (all.step() == SQLITE_ROW) {
-    places.push_back({static_cast<double>(all.integer(0)) / 1e5, static_cast<double>(all.integer(1)) / 1e5});
+    // Twelve bytes a place, of which the first four are its position in the square: see make-gazetteer.
+    const auto data = all.blob(1);
+    for (std::size_t at = 0; at + 12 <= data.size(); at += 12) {
+      const auto number = [&](std::size_t of) {
+        return std::to_integer<int>(data[at + of]) + 256 * std::to_integer<int>(data[at + of + 1]);
+      };
+      places.push_back({static_cast<double>(all.integer(0) / 1440 * 25000 + number(2)) / 1e5 - 90,
+                        static_cast<double>(all.integer(0) % 1440 * 25000 + number(0)) / 1e5 - 180});
+    }
   }
   std::mt19937 random(1);
   std::normal_distribution<double> aside(0, 0.05);  // degrees; a walk around the town
@@ -217,7 +225,7 @@ bool measureLookUps(const char* path, int count) {
   const bool within = slow < kMostOfALookUp;
   std::printf("%-32s %8.1f us   %.1f times one row read by number (%.1f us)\n", "look-up, median", median,
               median / quantile(bare, 0.5), quantile(bare, 0.5));
-  std::printf("%-32s %8.1f us   ratio %.3f to 1 ms, below 1  %s\n", "look-up, 99 of 100", slow,
+  std::printf("%-32s %8.1f us   ratio %.3f to 0.1 ms, below 1  %s\n", "look-up, 99 of 100", slow,
               slow / kMostOfALookUp, within ? "ok" : "ABOVE");
   return within;
 }

@@ -23,8 +23,14 @@ set(BRENVIK_ENTITLEMENT_DIRECTORIES "/etc/brenvik/entitlements.d;/usr/lib/brenvi
     CACHE STRING "Entitlement files, earlier directories first")
 set(BRENVIK_LASD_HOST "lasd.norvale.example" CACHE STRING "Update server, HTTPS; host or host:port")
 set(BRENVIK_GEOCODER_URL "" CACHE STRING "Nominatim-compatible server; empty: none")
+set(BRENVIK_GEOCODER_PACE "1000" CACHE STRING "Least milliseconds between two requests to the geocoder")
+if(NOT BRENVIK_GEOCODER_PACE MATCHES "^[0-9]+$" OR BRENVIK_GEOCODER_PACE GREATER 4000)
+  message(FATAL_ERROR "BRENVIK_GEOCODER_PACE must be 0 to 4000 milliseconds, it is \"${BRENVIK_GEOCODER_PACE}\"")
+endif()
 set(BRENVIK_STUN_SERVER "stun.norvale.example:3478" CACHE STRING "STUN server for the public address")
 set(BRENVIK_GAZETTEER "/usr/share/brenvik/gazetteer.db" CACHE STRING "Offline place database")
+set(BRENVIK_DISPUTED_AREAS "${PROJECT_SOURCE_DIR}/data/gazetteer/disputed.tsv"
+    CACHE FILEPATH "Table of what country is answered on disputed land")
 set(BRENVIK_COUNTRY_CONFIGURATION "/var/lib/brenvik/country.plist" CACHE STRING "Shared country configuration")
 set(BRENVIK_REACHABILITY_ADDRESS "192.0.2.1" CACHE STRING "Heartbeat destination, IPv4")
 set(BRENVIK_ANY_USER_PREFERENCES "/var/lib/brenvik/Library/Preferences"

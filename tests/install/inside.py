@@ -266,7 +266,8 @@ def stun_server(seen_as):
 # ---- steps, in order -------------------------------------------------------------------------------------------
 
 
-PACKAGES = ("brenvik-mobile-helper", "bvhelperctl", "libbrenvik-mobile-helper0", "libbrenvik-mobile-helper-dev")
+PACKAGES = ("brenvik-mobile-helper", "brenvik-mobile-helper-data", "bvhelperctl", "libbrenvik-mobile-helper0",
+            "libbrenvik-mobile-helper-dev")
 # What is there before the packages come. What the package manager, accounts and the journal write is theirs.
 BEFORE = set()
 NOT_THE_PACKAGES_OWN = ("/proc", "/sys", "/dev", "/run", "/tmp", "/out", "/test", "/packages", "/var/lib/dpkg", "/var/log",

@@ -6,7 +6,6 @@
 #include <array>
 #include <cmath>
 #include <cstring>
-#include <map>
 #include <numbers>
 
 namespace brenvik {
@@ -14,7 +13,13 @@ namespace {
 
 // As the maker of the database writes them.
 constexpr std::int64_t kApplicationId = 0x42764761;
-constexpr std::int64_t kFormat = 1;
+constexpr std::int64_t kFormat = 2;
+constexpr std::int64_t kSquare = 25'000;
+constexpr std::int64_t kColumns = 1440;
+constexpr std::int64_t kRows = 720;
+constexpr int kLargestLeaf = 26;  // log2
+constexpr std::size_t kPlaceSize = 12;
+constexpr double kHeaviest = 8;  // kilometres
 
 constexpr double kUnitsPerDegree = 100'000;
 constexpr std::int64_t kHalfTurn = 18'000'000;
@@ -26,8 +31,8 @@ constexpr double kEarthRadius = 6371.0;           // kilometres
 // its neighbours are as likely to be something else.
 constexpr double kCityReach = 50;
 constexpr double kAreaReach = 150;
-// Most places have a neighbour within the first ring: a small box holds few rows to read.
-constexpr std::array kSearchRadii{3.0, 10.0, 25.0, kCityReach, kAreaReach};
+// Almost every position has a town within the first circle: few rows to read.
+constexpr std::array kSearchRadii{12.0, 25.0, kCityReach + kHeaviest, kAreaReach + kHeaviest};
 
 double radians(std::int64_t units) {
   return static_cast<double>(units) / kUnitsPerDegree * std::numbers::pi / 180;
@@ -39,6 +44,17 @@ double kilometresBetween(double lng1, double lat1, double lng2, double lat2) {
   const double sinLng = std::sin((lng2 - lng1) / 2);
   const double h = sinLat * sinLat + std::cos(lat1) * std::cos(lat2) * sinLng * sinLng;
   return 2 * kEarthRadius * std::asin(std::min(1.0, std::sqrt(h)));
+}
+
+// Outside a town, how far it is to its edge. Inside, how near its middle is as a share of the way: small
+// towns that touch a large one keep their own ground.
+constexpr double kInside = 3;
+double scoreOf(double kilometres, double weight) {
+  return kilometres >= weight ? kilometres - weight : kInside * (kilometres / weight - 1);
+}
+// The distance at which a town of this weight has the score.
+double distanceOfScore(double score, double weight) {
+  return score >= 0 ? score + weight : weight * (1 + score / kInside);
 }
 
 std::string percentEncoded(const std::string& path) {
@@ -59,29 +75,81 @@ std::string percentEncoded(const std::string& path) {
   return uri;
 }
 
-// True when the ring, a closed line of (longitude, latitude) pairs of 32-bit numbers, goes around the
-// position. A position on the line belongs to exactly one of the two sides.
-bool goesAround(std::span<const std::byte> ring, std::int64_t lng, std::int64_t lat) {
-  const std::size_t count = ring.size() / 8;
-  const auto point = [&](std::size_t i) {
-    std::array<std::int32_t, 2> pair;
-    std::memcpy(pair.data(), ring.data() + i * 8, 8);
-    return pair;
-  };
+// Reads LEB128 numbers. Past the end, and of one that is too long, it reads zeros and is broken.
+class Numbers {
+ public:
+  explicit Numbers(std::span<const std::byte> bytes) : bytes_(bytes) {}
+  bool atEnd() const { return at_ == bytes_.size(); }
+  bool isBroken() const { return broken_; }
+  std::uint32_t next() {
+    std::uint32_t number = 0;
+    for (unsigned shift = 0; shift < 32 && at_ < bytes_.size(); shift += 7) {
+      const auto byte = std::to_integer<std::uint32_t>(bytes_[at_++]);
+      number |= (byte & 127U) << shift;
+      if (byte < 128) return number;
+    }
+    broken_ = true;
+    at_ = bytes_.size();
+    return 0;
+  }
+  std::int64_t nextSigned() {
+    const std::uint32_t number = next();
+    return static_cast<std::int64_t>(number >> 1) ^ -static_cast<std::int64_t>(number & 1);
+  }
+
+ private:
+  std::span<const std::byte> bytes_;
+  std::size_t at_ = 0;
+  bool broken_ = false;
+};
+
+// Reads a ring of `count` corners, the first one counted from `from`. True when it goes around the position;
+// one on the line belongs to exactly one of the two sides.
+bool goesAround(Numbers& ring, std::uint32_t count, std::array<std::int64_t, 2> from, std::int64_t x,
+                std::int64_t y) {
+  std::array<std::int64_t, 2> first{};
   bool inside = false;
-  if (count == 0) return false;
-  auto from = point(count - 1);
-  for (std::size_t i = 0; i < count; ++i) {
-    const auto to = point(i);
-    if ((from[1] > lat) != (to[1] > lat)) {
-      // Where the edge meets the position's parallel, east of the position or not; multiplied out, so exact.
-      const std::int64_t rise = std::int64_t{to[1]} - from[1];
-      const std::int64_t offset = (lng - from[0]) * rise - (std::int64_t{to[0]} - from[0]) * (lat - from[1]);
-      if (rise > 0 ? offset < 0 : offset > 0) inside = !inside;
+  const auto edge = [&](const auto& a, const auto& b) {
+    if ((a[1] > y) == (b[1] > y)) return;
+    // Where the edge meets the position's parallel, east of the position or not; multiplied out, so exact.
+    const std::int64_t rise = b[1] - a[1];
+    const std::int64_t offset = (x - a[0]) * rise - (b[0] - a[0]) * (y - a[1]);
+    if (rise > 0 ? offset < 0 : offset > 0) inside = !inside;
+  };
+  for (std::uint32_t i = 0; i < count && !ring.isBroken(); ++i) {
+    std::array<std::int64_t, 2> to = from;
+    to[0] += ring.nextSigned();
+    to[1] += ring.nextSigned();
+    // Nothing true lies outside the quadtree's square, and the products above must not overflow.
+    constexpr std::int64_t kWorld = std::int64_t{1} << kLargestLeaf;
+    if (to[0] < 0 || to[1] < 0 || to[0] > kWorld || to[1] > kWorld) to = {};
+    if (i == 0) {
+      first = to;
+    } else {
+      edge(from, to);
     }
     from = to;
   }
+  edge(from, first);
   return inside;
+}
+
+// The Z-order number of the smallest square of the quadtree that a position lies in.
+std::int64_t zOrder(std::int64_t x, std::int64_t y) {
+  std::int64_t number = 0;
+  for (unsigned bit = 0; bit < 14; ++bit) {
+    number |= (x >> 12 >> bit & 1) << 2 * bit | (y >> 12 >> bit & 1) << (2 * bit + 1);
+  }
+  return number;
+}
+
+template <typename Number>
+Number littleEndian(std::span<const std::byte> bytes) {
+  Number number = 0;
+  for (std::size_t i = 0; i < sizeof(Number); ++i) {
+    number = static_cast<Number>(number | std::to_integer<Number>(bytes[i]) << 8 * i);
+  }
+  return number;
 }
 
 }  // namespace
@@ -114,48 +182,125 @@ bool Gazetteer::open(std::string& error) {
     error = "not a gazetteer of this version";
     return false;
   }
-  constexpr std::string_view kRings =
-      "select g.id, g.country, r.points from ring_at a join ring r on r.id = a.id join region g on g.id = "
-      "r.region "
-      "where a.min_lng <= ?1 and a.max_lng >= ?1 and a.min_lat <= ?2 and a.max_lat >= ?2";
-  constexpr std::string_view kPlaces =
-      "select a.min_lng, a.min_lat, p.name, p.country, p.area from place_at a join place p on p.id = a.id "
-      "where a.min_lng >= ?1 and a.max_lng <= ?2 and a.min_lat >= ?3 and a.max_lat <= ?4";
-  const std::string placesOfCountry = std::string(kPlaces) + " and (p.country = ?5 or p.border = ?5)";
-  Opened opened{std::move(database), Query(*functions, handle, kRings), Query(*functions, handle, kPlaces),
-                Query(*functions, handle, placesOfCountry),
-                Query(*functions, handle, "select name from area where id = ?1")};
-  if (!opened.rings.isValid() || !opened.places.isValid() || !opened.placesOfCountry.isValid() ||
-      !opened.area.isValid()) {
+  Opened opened{
+      std::move(database),
+      Query(*functions, handle, "select data from land where cell <= ?1 order by cell desc limit 1"),
+      Query(*functions, handle, "select cell, data from near where cell between ?1 and ?2"),
+      Query(*functions, handle,
+            "select t.name, a.name from place p join place t on t.id = ifnull(p.town, p.id) left join area a "
+            "on a.id = p.area "
+            "where p.id = ?1"),
+      {},
+      {},
+      {}};
+  if (!opened.land.isValid() || !opened.near.isValid() || !opened.place.isValid()) {
     error = functions->errmsg(handle);
     return false;
   }
   opened_ = std::move(opened);
-  return true;
+  failure_.reset();
+  try {
+    if (readTables()) return true;
+  } catch (...) {
+    opened_.reset();
+    throw;
+  }
+  error = failure_.value_or("its tables are incomplete");
+  opened_.reset();
+  return false;
+}
+
+// Countries, layers and rules are few, and every look-up needs them.
+bool Gazetteer::readTables() {
+  constexpr std::size_t kMost = 4096;  // of each: what has more is no gazetteer
+  const auto readAll = [this](const char* sql, const auto& take) {
+    Query rows(*sqlite(), opened_->database.get(), sql);
+    if (!rows.isValid()) {
+      failure_ = sqlite()->errmsg(opened_->database.get());
+      return false;
+    }
+    int code = rows.step();
+    std::size_t count = 1;
+    for (; code == SQLITE_ROW; code = rows.step(), ++count) {
+      if (count > kMost || rows.integer(0) != static_cast<std::int64_t>(count) || !take(rows)) return false;
+    }
+    finish(rows, code);
+    return !failure_ && count > 1;
+  };
+  auto& [database, land, near, place, countries, layers, rules] = *opened_;
+  countries.emplace_back();
+  layers.emplace_back();
+  const auto isCountry = [&countries = countries](std::int64_t number) {
+    return number > 0 && number < static_cast<std::int64_t>(countries.size());
+  };
+  if (!readAll("select id, code, sovereign from country order by id", [&countries = countries](Query& row) {
+        countries.push_back({std::string(row.text(1)), std::string(row.text(2))});
+        return countries.size() <= 256;
+      })) {
+    return false;
+  }
+  if (!readAll("select id, country from layer order by id", [&layers = layers, &isCountry](Query& row) {
+        layers.push_back(static_cast<std::uint8_t>(row.integer(1)));
+        return row.integer(1) == 0 || isCountry(row.integer(1));
+      })) {
+    return false;
+  }
+  // A table of disputed land may be empty.
+  (void)readAll("select id, country, needs from rule order by id", [&rules = rules, &isCountry](Query& row) {
+    if (!isCountry(row.integer(1))) return false;
+    Rule rule{static_cast<std::uint8_t>(row.integer(1)), {}};
+    const auto needs = row.blob(2);
+    for (std::size_t at = 0; at + 2 <= needs.size(); at += 2) {
+      rule.needs.push_back(littleEndian<std::uint16_t>(needs.subspan(at)));
+    }
+    std::sort(rule.needs.begin(), rule.needs.end());
+    rules.push_back(std::move(rule));
+    return true;
+  });
+  return !failure_;
+}
+
+Gazetteer::Position Gazetteer::positionOf(Coordinate coordinate) {
+  return {std::llround(coordinate.longitude * kUnitsPerDegree),
+          std::llround(coordinate.latitude * kUnitsPerDegree)};
 }
 
 Gazetteer::Answer Gazetteer::lookUp(Coordinate coordinate) {
   std::string error;
   if (!open(error)) return {{}, GeoError{"the offline gazetteer cannot be read: " + error}};
   failure_.reset();
-  const Position position{std::llround(coordinate.longitude * kUnitsPerDegree),
-                          std::llround(coordinate.latitude * kUnitsPerDegree)};
-
+  const Position position = positionOf(coordinate);
   Answer answer;
-  auto country = countryAround(position);
-  auto place = nearestPlace(position, country ? &*country : nullptr, country ? kAreaReach : kCityReach);
+  std::uint8_t country = landAround(position).country;
+  const auto town = townNear(position, country);
   // Off every border, the nearest town's country is the best there is; so it is where a border has no
   // country.
-  if (!country && place) country = place->country;
-  if (country) {
+  if (country == 0 && town && town->kilometres <= kCityReach) country = town->country;
+  if (country != 0) {
     StructuredAddress address;
-    address.countryCode = std::move(country);
-    if (place && place->area) address.administrativeArea = areaName(*place->area);
-    if (place && place->kilometres <= kCityReach) address.locality = std::move(place->name);
+    address.countryCode = opened_->countries[country].code;
+    if (town) nameTown(*town, address);
     answer.address = std::move(address);
   }
-  if (failure_) return {{}, GeoError{"the offline gazetteer is damaged: " + *failure_}};
+  if (failure_) {
+    answer = {{}, GeoError{"the offline gazetteer is damaged: " + *failure_}};
+    // The file may be another one by the time of the next look-up.
+    opened_.reset();
+  }
   return answer;
+}
+
+std::string Gazetteer::ownCode(Coordinate coordinate, const std::string& country) {
+  std::string error;
+  if (!open(error)) return country;
+  failure_.reset();
+  const Land land = landAround(positionOf(coordinate));
+  if (failure_) {
+    opened_.reset();
+    return country;
+  }
+  const Country& ours = opened_->countries[land.country];
+  return land.country != 0 && (land.disputed || ours.sovereign == country) ? ours.code : country;
 }
 
 void Gazetteer::finish(Query& statement, int code) {
@@ -167,38 +312,76 @@ void Gazetteer::finish(Query& statement, int code) {
 
 // Borders meet the antimeridian from one side or the other, and the pole from one: a position on the edge of
 // the map is asked for on either side, a hair's breadth inside.
-std::optional<std::string> Gazetteer::countryAround(Position position) {
+Gazetteer::Land Gazetteer::landAround(Position position) {
   position.lat = std::clamp(position.lat, -kQuarterTurn + 1, kQuarterTurn - 1);
-  if (std::abs(position.lng) < kHalfTurn) return countryAt(position);
-  if (auto east = countryAt({kHalfTurn - 1, position.lat})) return east;
-  return countryAt({-kHalfTurn + 1, position.lat});
+  if (std::abs(position.lng) < kHalfTurn) return landAt(position);
+  if (const Land east = landAt({kHalfTurn - 1, position.lat}); east.country != 0) return east;
+  return landAt({-kHalfTurn + 1, position.lat});
 }
 
-std::optional<std::string> Gazetteer::countryAt(Position position) {
-  // A region is an area with holes: inside an odd number of its rings is inside. Regions do not overlap.
-  std::map<std::int64_t, std::pair<bool, std::string>> regions;
-  const Query::Run run(opened_->rings);
-  opened_->rings.bind(1, position.lng);
-  opened_->rings.bind(2, position.lat);
-  int code = opened_->rings.step();
-  for (; code == SQLITE_ROW; code = opened_->rings.step()) {
-    if (!goesAround(opened_->rings.blob(2), position.lng, position.lat)) continue;
-    auto& [inside, country] = regions[opened_->rings.integer(0)];
-    inside = !inside;
-    country = opened_->rings.text(1);
+Gazetteer::Land Gazetteer::landAt(Position position) {
+  const std::int64_t x = position.lng + kHalfTurn;
+  const std::int64_t y = position.lat + kQuarterTurn;
+  const Query::Run run(opened_->land);
+  opened_->land.bind(1, zOrder(x, y));
+  const int code = opened_->land.step();
+  Land land;
+  if (code == SQLITE_ROW) {
+    Numbers leaf(opened_->land.blob(0));
+    const std::uint32_t size = leaf.next();
+    const std::int64_t corner = size <= kLargestLeaf ? -(std::int64_t{1} << size) : 0;
+    std::array<std::uint16_t, 64> around{};  // the layers that the position lies in, in ascending order
+    std::size_t count = 0;
+    while (!leaf.atEnd() && !leaf.isBroken()) {
+      const std::uint32_t rings = leaf.next();
+      const std::uint32_t layer = leaf.next();
+      bool inside = rings == 0;
+      for (std::uint32_t i = 0; i < rings && !leaf.isBroken(); ++i) {
+        const std::uint32_t corners = leaf.next();
+        inside ^= goesAround(leaf, corners, {x & corner, y & corner}, x, y);
+      }
+      if (layer == 0 || layer >= opened_->layers.size() || (inside && count == around.size())) {
+        failure_ = "its borders cannot be read";
+        break;
+      }
+      if (inside) around[count++] = static_cast<std::uint16_t>(layer);
+    }
+    if (leaf.isBroken() && !failure_) failure_ = "its borders cannot be read";
+    land = decide(std::span(around).first(count));
   }
-  finish(opened_->rings, code);
-  for (auto& [id, region] : regions) {
-    if (region.first) return std::move(region.second);
-  }
-  return std::nullopt;
+  finish(opened_->land, code);
+  return land;
 }
 
-std::optional<Gazetteer::Place> Gazetteer::nearestPlace(Position position, const std::string* country,
-                                                        double kilometres) {
-  std::optional<Place> nearest;
+// The first rule of disputed land that fits, else the layer of the highest rank.
+Gazetteer::Land Gazetteer::decide(std::span<const std::uint16_t> around) const {
+  for (const Rule& rule : opened_->rules) {
+    if (std::includes(around.begin(), around.end(), rule.needs.begin(), rule.needs.end())) {
+      return {rule.country, true};
+    }
+  }
+  for (const std::uint16_t layer : around) {
+    if (opened_->layers[layer] != 0) return {opened_->layers[layer], false};
+  }
+  return {};
+}
+
+Gazetteer::Town* Gazetteer::Found::bestOf(std::uint16_t area) {
+  const auto found =
+      std::find_if(best.begin(), best.end(), [area](const Town& town) { return town.area == area; });
+  return found == best.end() ? nullptr : &*found;
+}
+
+const Gazetteer::Town& Gazetteer::Found::town() {
+  const Town& ofArea = *bestOf(nearest->area);
+  const Town& ofAll = *std::min_element(best.begin(), best.end(),
+                                        [](const Town& a, const Town& b) { return a.score < b.score; });
+  return ofArea.score > 0 && ofAll.score < 0 ? ofAll : ofArea;
+}
+
+std::optional<Gazetteer::Town> Gazetteer::townNear(Position position, std::uint8_t country) {
+  Found found;
   for (const double radius : kSearchRadii) {
-    if (radius > kilometres) break;
     const double height = radius / kKilometresPerDegree * kUnitsPerDegree;
     const auto south = static_cast<std::int64_t>(std::floor(static_cast<double>(position.lat) - height));
     const auto north = static_cast<std::int64_t>(std::ceil(static_cast<double>(position.lat) + height));
@@ -206,58 +389,98 @@ std::optional<Gazetteer::Place> Gazetteer::nearestPlace(Position position, const
     const double narrowest =
         std::cos(radians(std::min(std::max(std::abs(south), std::abs(north)), kQuarterTurn)));
     const double width = narrowest > 0 ? height / narrowest : 2.0 * kHalfTurn;
-    nearest.reset();
-    if (width >= kHalfTurn) {
-      searchBox(position, country, -kHalfTurn, kHalfTurn, south, north, nearest);
-    } else {
-      const auto west = static_cast<std::int64_t>(std::floor(static_cast<double>(position.lng) - width));
-      const auto east = static_cast<std::int64_t>(std::ceil(static_cast<double>(position.lng) + width));
-      searchBox(position, country, std::max(west, -kHalfTurn), std::min(east, kHalfTurn), south, north,
-                nearest);
+    const auto from = static_cast<double>(position.lng) - width + kHalfTurn;
+    const auto to = static_cast<double>(position.lng) + width + kHalfTurn;
+    const bool whole = width >= kHalfTurn;
+    const std::int64_t west = whole ? 0 : static_cast<std::int64_t>(std::floor(from / kSquare));
+    const std::int64_t east = whole ? kColumns - 1 : static_cast<std::int64_t>(std::floor(to / kSquare));
+    const std::int64_t first = std::max<std::int64_t>((south + kQuarterTurn) / kSquare, 0);
+    const std::int64_t last = std::min((north + kQuarterTurn) / kSquare, kRows - 1);
+    found.nearest.reset();
+    found.best.clear();
+    for (std::int64_t row = first; row <= last; ++row) {
+      searchRow(position, country, row, std::max<std::int64_t>(west, 0), std::min(east, kColumns - 1), radius,
+                found);
       // What sticks out beyond the antimeridian comes in again on the other side.
-      if (west < -kHalfTurn) {
-        searchBox(position, country, west + 2 * kHalfTurn, kHalfTurn, south, north, nearest);
-      }
-      if (east > kHalfTurn)
-        searchBox(position, country, -kHalfTurn, east - 2 * kHalfTurn, south, north, nearest);
+      if (west < 0) searchRow(position, country, row, west + kColumns, kColumns - 1, radius, found);
+      if (east >= kColumns) searchRow(position, country, row, 0, east - kColumns, radius, found);
     }
-    // In a corner of the box, the place found may be farther than one that is just outside.
-    if (nearest && nearest->kilometres <= radius) return nearest;
+    // A heavier town than the one found may still be just outside.
+    if (found.nearest && found.bestOf(found.nearest->area)->score <= radius - kHeaviest) break;
   }
-  if (nearest && nearest->kilometres > kilometres) nearest.reset();
-  return nearest;
+  if (!found.nearest || found.nearest->kilometres > kAreaReach) return std::nullopt;
+  return found.town();
 }
 
-void Gazetteer::searchBox(Position position, const std::string* country, std::int64_t west, std::int64_t east,
-                          std::int64_t south, std::int64_t north, std::optional<Place>& nearest) {
-  Query& statement = country != nullptr ? opened_->placesOfCountry : opened_->places;
-  const Query::Run run(statement);
-  statement.bind(1, west);
-  statement.bind(2, east);
-  statement.bind(3, south);
-  statement.bind(4, north);
-  if (country != nullptr) statement.bind(5, *country);
+void Gazetteer::searchRow(Position position, std::uint8_t country, std::int64_t row, std::int64_t west,
+                          std::int64_t east, double kilometres, Found& found) {
+  const Query::Run run(opened_->near);
+  opened_->near.bind(1, row * kColumns + west);
+  opened_->near.bind(2, row * kColumns + east);
+  int code = opened_->near.step();
+  for (; code == SQLITE_ROW; code = opened_->near.step()) {
+    searchSquare(position, country, opened_->near.integer(0), opened_->near.blob(1), kilometres, found);
+  }
+  finish(opened_->near, code);
+}
+
+void Gazetteer::searchSquare(Position position, std::uint8_t country, std::int64_t cell,
+                             std::span<const std::byte> data, double kilometres, Found& found) {
+  const std::int64_t west = cell % kColumns * kSquare - kHalfTurn;
+  const std::int64_t south = cell / kColumns * kSquare - kQuarterTurn;
   const double lng = radians(position.lng);
   const double lat = radians(position.lat);
-  int code = statement.step();
-  for (; code == SQLITE_ROW; code = statement.step()) {
-    const double kilometres =
-        kilometresBetween(lng, lat, radians(statement.integer(0)), radians(statement.integer(1)));
-    if (nearest && nearest->kilometres <= kilometres) continue;
-    nearest = Place{kilometres, std::string(statement.text(2)), std::string(statement.text(3)), {}};
-    if (!statement.isNull(4)) nearest->area = statement.integer(4);
+  const double cosine = std::cos(lat);
+  // Of the square's parallels the shortest.
+  const double shortest =
+      std::max(0.0, std::cos(radians(std::max(std::abs(south), std::abs(south + kSquare)))));
+  for (; data.size() >= kPlaceSize; data = data.subspan(kPlaceSize)) {
+    const auto itsCountry = std::to_integer<std::uint8_t>(data[5]);
+    if (itsCountry >= opened_->countries.size() || itsCountry == 0) {
+      if (!failure_) failure_ = "its places cannot be read";
+      return;
+    }
+    if (country != 0 && itsCountry != country) continue;
+    const double itsLng = radians(west + littleEndian<std::uint16_t>(data));
+    const double itsLat = radians(south + littleEndian<std::uint16_t>(data.subspan(2)));
+    const double weight = std::to_integer<int>(data[4]) / 10.0;
+    const auto area = littleEndian<std::uint16_t>(data.subspan(6));
+    Town* const best = found.bestOf(area);
+    // Farther away than this it can be neither the nearest nor the best of its area.
+    const double worst = best == nullptr
+                             ? kilometres
+                             : std::max(found.nearest->kilometres, distanceOfScore(best->score, weight));
+    // Never more than the distance, and much quicker: most places are out by it. Sine of x is above 0.99 x up
+    // to 0.24.
+    const double up = (itsLat - lat) / 2;
+    const double across = (itsLng - lng) / 2;
+    if (std::abs(across) < 0.24 &&
+        2 * kEarthRadius * 0.99 * std::sqrt(up * up + cosine * shortest * across * across) > worst) {
+      continue;
+    }
+    const double away = kilometresBetween(lng, lat, itsLng, itsLat);
+    if (away > kilometres) continue;
+    const Town town{scoreOf(away, weight), away, itsCountry, area,
+                    littleEndian<std::uint32_t>(data.subspan(8))};
+    if (!found.nearest || away < found.nearest->kilometres) found.nearest = town;
+    if (best == nullptr) {
+      found.best.push_back(town);
+    } else if (town.score < best->score) {
+      *best = town;
+    }
   }
-  finish(statement, code);
+  if (!data.empty() && !failure_) failure_ = "its places cannot be read";
 }
 
-std::optional<std::string> Gazetteer::areaName(std::int64_t area) {
-  const Query::Run run(opened_->area);
-  opened_->area.bind(1, area);
-  std::optional<std::string> name;
-  const int code = opened_->area.step();
-  if (code == SQLITE_ROW) name = opened_->area.text(0);
-  finish(opened_->area, code);
-  return name;
+void Gazetteer::nameTown(const Town& town, StructuredAddress& address) {
+  const Query::Run run(opened_->place);
+  opened_->place.bind(1, std::int64_t{town.place});
+  const int code = opened_->place.step();
+  if (code == SQLITE_ROW) {
+    if (town.kilometres <= kCityReach) address.locality = opened_->place.text(0);
+    if (!opened_->place.isNull(1)) address.administrativeArea = opened_->place.text(1);
+  }
+  finish(opened_->place, code);
 }
 
 }  // namespace brenvik

@@ -2,8 +2,13 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <array>
+#include <cstdint>
 #include <optional>
+#include <span>
 #include <string>
+#include <string_view>
+#include <vector>
 
 #include "platform/geo/GeoService.h"
 #include "platform/geo/linux/Query.h"
@@ -11,9 +16,9 @@
 
 namespace brenvik {
 
-// The offline gazetteer: a read-only SQLite database of country borders and places. The country is the one
-// whose border the coordinate lies in; city and administrative area are those of the nearest place of that
-// country. One thread at a time.
+// The offline gazetteer: a read-only SQLite database of borders and places. The country code is that of the
+// border that the coordinate lies in, or of the table of disputed land; city and administrative area are
+// those of the town that a resident would name. One thread at a time.
 class Gazetteer {
  public:
   // Opens nothing; the database is opened by the first look-up, and again by each that finds it closed.
@@ -27,37 +32,72 @@ class Gazetteer {
   // known.
   Answer lookUp(Coordinate coordinate);
 
+  // The code that this gazetteer's rules give a place that another source puts into `country`: the
+  // territory's own code instead of its sovereign's, and the table's answer on disputed land. Otherwise
+  // `country`, and so when the database cannot be read. The coordinate has to be one.
+  std::string ownCode(Coordinate coordinate, const std::string& country);
+
  private:
   struct Position {
     std::int64_t lng;  // 1e-5 degrees
     std::int64_t lat;
   };
-  struct Place {
-    double kilometres;
-    std::string name;
-    std::string country;
-    std::optional<std::int64_t> area;
+  struct Land {
+    std::uint8_t country = 0;  // 0: nobody's
+    bool disputed = false;
+  };
+  struct Town {
+    double score;       // kilometres beyond the town's edge; below 0 inside
+    double kilometres;  // to its middle
+    std::uint8_t country;
+    std::uint16_t area;  // 0: none
+    std::uint32_t place;
+  };
+  // What a search has found so far.
+  struct Found {
+    std::optional<Town> nearest;  // whatever its size: its area is the position's
+    std::vector<Town> best;       // of each area the town of the least score
+    Town* bestOf(std::uint16_t area);
+    // Of the found, which are not none, the one that names the position.
+    const Town& town();
+  };
+  struct Country {
+    std::string code;
+    std::string sovereign;  // of a territory, else empty
+  };
+  struct Rule {
+    std::uint8_t country;
+    std::vector<std::uint16_t> needs;  // layers, in ascending order
   };
 
+  static Position positionOf(Coordinate coordinate);
   bool open(std::string& error);
+  bool readTables();
   // Ends a run of a statement, whose last step gave `code`.
   void finish(Query& statement, int code);
-  std::optional<std::string> countryAt(Position position);
-  std::optional<std::string> countryAround(Position position);
-  // The nearest place within `kilometres`, of the country if one is named.
-  std::optional<Place> nearestPlace(Position position, const std::string* country, double kilometres);
-  void searchBox(Position position, const std::string* country, std::int64_t west, std::int64_t east,
-                 std::int64_t south, std::int64_t north, std::optional<Place>& nearest);
-  std::optional<std::string> areaName(std::int64_t area);
+  Land landAround(Position position);
+  Land landAt(Position position);
+  Land decide(std::span<const std::uint16_t> around) const;
+  // The town that names the position: of the towns in the area of the nearest place the one of the least
+  // score. Of the country unless that is 0.
+  std::optional<Town> townNear(Position position, std::uint8_t country);
+  void searchRow(Position position, std::uint8_t country, std::int64_t row, std::int64_t west,
+                 std::int64_t east, double kilometres, Found& found);
+  void searchSquare(Position position, std::uint8_t country, std::int64_t cell,
+                    std::span<const std::byte> data, double kilometres, Found& found);
+  // Name and area of a place.
+  void nameTown(const Town& town, StructuredAddress& address);
 
   const std::string path_;
   // The statements go before their database does.
   struct Opened {
     SqliteDatabase database;
-    Query rings;
-    Query places;
-    Query placesOfCountry;
-    Query area;
+    Query land;
+    Query near;
+    Query place;
+    std::vector<Country> countries;    // by number; 0 is nobody
+    std::vector<std::uint8_t> layers;  // country of each; 0: an outline
+    std::vector<Rule> rules;
   };
   std::optional<Opened> opened_;
   std::optional<std::string> failure_;  // the first error that a statement of this look-up met

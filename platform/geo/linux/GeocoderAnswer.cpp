@@ -9,9 +9,17 @@
 namespace brenvik {
 namespace {
 
-// The parts an address is read from. Of the four kinds of city the first that is there names it.
-constexpr std::array<std::string_view, 7> kParts{"country_code", "state",   "postcode",    "city",
-                                                 "town",         "village", "municipality"};
+// What names the town, the first that is there: a town before the quarters that some places are all mapped
+// as. The offline answers follow the same rule.
+constexpr std::array<std::string_view, 10> kTowns{"city",          "town",         "village", "municipality",
+                                                  "city_district", "borough",      "suburb",  "hamlet",
+                                                  "quarter",       "neighbourhood"};
+// The parts an address is read from.
+constexpr auto kParts = [] {
+  std::array<std::string_view, 3 + kTowns.size()> parts{"country_code", "state", "postcode"};
+  std::copy(kTowns.begin(), kTowns.end(), parts.begin() + 3);
+  return parts;
+}();
 
 // Takes from the stream of values the two facts wanted, and keeps nothing else: no tree is built of what a
 // server sends. Nesting costs a bit a level.
@@ -113,7 +121,7 @@ GeocoderAnswer readGeocoderAnswer(std::string_view body) {
   address.countryCode = countryCode(reader.part("country_code"));
   address.administrativeArea = reader.part("state");
   address.postCode = reader.part("postcode");
-  for (const auto* kind : {"city", "town", "village", "municipality"}) {
+  for (const std::string_view kind : kTowns) {
     if (!address.locality) address.locality = reader.part(kind);
   }
   return {std::move(address), {}};

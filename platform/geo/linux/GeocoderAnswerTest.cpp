@@ -37,7 +37,17 @@ TEST(GeocoderAnswerTest, TheCityIsTheFirstOfCityTownVillageAndMunicipality) {
   EXPECT_EQ(addressIn(R"({"address":{"municipality":"M","village":"V","town":"T"}})").locality, "T");
   EXPECT_EQ(addressIn(R"({"address":{"municipality":"M","village":"V"}})").locality, "V");
   EXPECT_EQ(addressIn(R"({"address":{"municipality":"M"}})").locality, "M");
-  EXPECT_EQ(addressIn(R"({"address":{"hamlet":"H"}})").locality, std::nullopt);
+  EXPECT_EQ(addressIn(R"({"address":{"road":"R"}})").locality, std::nullopt);
+}
+
+TEST(GeocoderAnswerTest, AQuarterNamesTheCityWhereNothingLargerDoes) {
+  EXPECT_EQ(addressIn(R"({"address":{"suburb":"Mitte","city":"Berlin"}})").locality, "Berlin");
+  EXPECT_EQ(
+      addressIn(R"({"address":{"neighbourhood":"N","hamlet":"H","suburb":"S","borough":"B"}})").locality,
+      "B");
+  EXPECT_EQ(addressIn(R"({"address":{"neighbourhood":"N","hamlet":"H","suburb":"S"}})").locality, "S");
+  EXPECT_EQ(addressIn(R"({"address":{"neighbourhood":"N","hamlet":"H"}})").locality, "H");
+  EXPECT_EQ(addressIn(R"({"address":{"neighbourhood":"N"}})").locality, "N");
 }
 
 TEST(GeocoderAnswerTest, PartsOutsideTheAddressDoNotCount) {

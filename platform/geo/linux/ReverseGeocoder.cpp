@@ -85,7 +85,7 @@ void ReverseGeocoder::ask(Coordinate coordinate, Deliver deliver, const std::sha
   const auto now = now_();
   const auto turn = std::max(now, nextTurn_);
   if (turn - now > kLongestTurn) return answerOffline(coordinate, deliver, "too many requests");
-  nextTurn_ = turn + kGeocoderPace;
+  nextTurn_ = turn + pace_;
   if (turn == now) return send(coordinate, deliver, queue);
   queue->postAfter(turn - now, [weak = weak_from_this(), coordinate, deliver = std::move(deliver),
                                 weakQueue = std::weak_ptr(queue)] {
@@ -139,6 +139,9 @@ void ReverseGeocoder::takeResponse(Coordinate coordinate, const Deliver& deliver
   auto answer =
       readGeocoderAnswer({reinterpret_cast<const char*>(response->body.data()), response->body.size()});
   if (answer.error) return answerOffline(coordinate, deliver, answer.error->description);
+  if (answer.address && answer.address->countryCode) {
+    answer.address->countryCode = gazetteer_.ownCode(coordinate, *answer.address->countryCode);
+  }
   deliverAddress(std::move(answer.address), deliver);
 }
 

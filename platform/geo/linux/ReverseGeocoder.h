@@ -18,8 +18,9 @@ namespace brenvik {
 
 // From sending a request to the end of its answer.
 inline constexpr std::chrono::seconds kGeocoderPatience{10};
-// What public servers ask of their users: no more than one request in this time.
-inline constexpr std::chrono::seconds kGeocoderPace{1};
+// Between two requests. One second is what public servers ask of their users; a server of one's own may need
+// none.
+inline constexpr std::chrono::milliseconds kGeocoderPace{BRENVIK_GEOCODER_PACE};
 // Longer than this nobody waits for his turn: the offline gazetteer answers instead.
 inline constexpr std::chrono::seconds kLongestTurn{4};
 
@@ -34,11 +35,13 @@ class ReverseGeocoder : public std::enable_shared_from_this<ReverseGeocoder> {
 
   // `serverUrl` empty: no server, and `webClient` is not used. `found` is told the country of each answer.
   ReverseGeocoder(std::string serverUrl, std::string gazetteerPath, WebClient& webClient, Now now,
-                  std::function<void(const std::string&)> found)
+                  std::function<void(const std::string&)> found,
+                  std::chrono::milliseconds pace = kGeocoderPace)
       : serverUrl_(std::move(serverUrl)),
         webClient_(webClient),
         now_(std::move(now)),
         found_(std::move(found)),
+        pace_(pace),
         gazetteer_(std::move(gazetteerPath)) {}
 
   // Answers later, unless closed by then. On `queue`, which the caller keeps while there is something to
@@ -60,6 +63,7 @@ class ReverseGeocoder : public std::enable_shared_from_this<ReverseGeocoder> {
   WebClient& webClient_;
   const Now now_;
   const std::function<void(const std::string&)> found_;
+  const std::chrono::milliseconds pace_;
   Gazetteer gazetteer_;
   std::chrono::nanoseconds nextTurn_{std::chrono::nanoseconds::min()};
   std::mutex atWork_;

@@ -30,11 +30,11 @@ class ReverseGeocoderTest : public testing::Test {
     std::optional<GeoError> error;
   };
 
-  std::shared_ptr<ReverseGeocoder> geocoder(std::string serverUrl,
-                                            std::string gazetteer = GAZETTEER_DATABASE) {
+  std::shared_ptr<ReverseGeocoder> geocoder(std::string serverUrl, std::string gazetteer = GAZETTEER_DATABASE,
+                                            std::chrono::milliseconds pace = 1s) {
     return std::make_shared<ReverseGeocoder>(
         std::move(serverUrl), std::move(gazetteer), web, [this] { return clock.now(); },
-        [this](const std::string& code) { countries.push_back(code); });
+        [this](const std::string& code) { countries.push_back(code); }, pace);
   }
   void ask(const std::shared_ptr<ReverseGeocoder>& of, Coordinate coordinate) {
     of->lookUp(
@@ -145,6 +145,35 @@ TEST_F(ReverseGeocoderTest, PartsOfAnyLengthTravelWholeUpToWhatAPushCarries) {
   EXPECT_EQ(answerWith(city + city + "ø", "s").locality, std::nullopt) << "120,002";
   EXPECT_EQ(answerWith(std::string(70'000, 'c'), "s").postCode, "0150");
   EXPECT_EQ(answerWith(std::string(70'000, 'c'), "s").administrativeArea, "s");
+}
+
+TEST_F(ReverseGeocoderTest, TheServersCountryCodeFollowsTheSameRulesAsTheGazetteers) {
+  struct Case {
+    Coordinate at;
+    const char* server;
+    const char* own;
+  };
+  for (const Case& each : {Case{{22.3, 114.17}, "cn", "HK"}, Case{{18.45, -66.07}, "us", "PR"},
+                           Case{{44.95, 34.1}, "ru", "UA"}, Case{{59.9133, 10.739}, "no", "NO"}}) {
+    answers.clear();
+    const auto online = geocoder(kServer);
+    ask(online, each.at);
+    web.answer(web.seen().back().url, 200,
+               std::string(R"({"address":{"city":"C","country_code":")") + each.server + "\"}}");
+    ask(geocoder(kServer), each.at);
+    ASSERT_FALSE(answers.empty());
+    EXPECT_EQ(addressOf(answers.back()).countryCode, each.own);
+    EXPECT_EQ(addressOf(answers.back()).locality, "C");
+    EXPECT_EQ(countries.back(), each.own);
+  }
+}
+
+TEST_F(ReverseGeocoderTest, AServerOfOnesOwnMayBeAskedWithoutPause) {
+  web.answer(kOsloUrl, 200, kOsloAnswer);
+  const auto online = geocoder(kServer, GAZETTEER_DATABASE, 0ms);
+  for (int i = 0; i < 5; ++i) ask(online, kOslo);
+  EXPECT_EQ(web.seen().size(), 5U);
+  EXPECT_EQ(answers.size(), 5U);
 }
 
 TEST_F(ReverseGeocoderTest, CoordinatesAreSentWithoutExponent) {
