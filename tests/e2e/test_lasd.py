@@ -164,6 +164,20 @@ class Updates(UpdateTest):
         self.assert_installed(manifest)
         self.logs.wait_for("unified", INFO, f"Removed old database {DIRECTORY}/gsm.db")
 
+    def test_a_record_that_another_process_removes_or_replaces_decides_the_next_check(self):
+        manifest = self.serve({"gsm": "1"})
+        self.assertEqual(self.check(MASKS["gsm"]), available(["gsm"]))
+        self.assertEqual(self.check(MASKS["gsm"]), ["NoUpdateRequired"])
+        changed = RECORDS.with_suffix(".new")
+        for records in ({"other": "stays"}, {"gsm": {"Version": "0"}, "other": "stays"}):
+            changed.write_bytes(plistlib.dumps(records))
+            changed.rename(RECORDS)
+            self.assertEqual(self.check(MASKS["gsm"]), available(["gsm"]))
+            self.assertEqual(self.records(), {**manifest, "other": "stays"})
+        RECORDS.unlink()
+        self.assertEqual(self.check(MASKS["gsm"]), available(["gsm"]))
+        self.assertEqual(self.records(), manifest)
+
     def test_mask_0_fetches_the_manifest_and_finds_nothing(self):
         self.serve({"gsm": "1"})
         self.assertEqual(self.check(0), ["NoUpdateRequired"])

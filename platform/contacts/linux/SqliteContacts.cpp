@@ -131,7 +131,9 @@ bool SqliteChannelManager::open(const std::string& path) {
   if (isLackOfMemory(version) || isLackOfMemory(sql->extended_errcode(opened))) throw std::bad_alloc();
   if (isHopeless(version)) return false;
   limit_.applyTo(opened);
-  (void)sql->exec(opened, "PRAGMA synchronous=FULL; PRAGMA cell_size_check=ON", nullptr, nullptr, nullptr);
+  // EXTRA: the folder is synced as well when the journal goes, or a power cut could bring the journal back,
+  // and with it the old channels after a success was answered.
+  (void)sql->exec(opened, "PRAGMA synchronous=EXTRA; PRAGMA cell_size_check=ON", nullptr, nullptr, nullptr);
   return true;
 }
 

@@ -17,6 +17,7 @@
 #include <optional>
 #include <string>
 #include <utility>
+#include <vector>
 
 #include "platform/contacts/fakes/InMemoryContacts.h"
 #include "platform/sqlite/Sqlite.h"
@@ -113,6 +114,34 @@ TEST_F(SqliteContactsTest, TheDatabaseKeepsItsOwnerItsModeAndItsFolderClean) {
   ASSERT_EQ(::stat(database().c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 07777U, 0600U);
   EXPECT_EQ(std::distance(fs::directory_iterator(database().parent_path()), fs::directory_iterator()), 1);
+}
+
+TEST_F(SqliteContactsTest, AnAnsweredRemapIsHeldFastInItsFolder) {
+  makeDatabase();
+  // With the journal's name gone, the folder is synced.
+  static std::vector<std::string> calls;
+  calls.clear();
+  sqlite3_vfs* const files = sqlite()->vfs_find(nullptr);
+  static const auto realUnlink =
+      reinterpret_cast<int (*)(const char*)>(files->xGetSystemCall(files, "unlink"));
+  static const auto realOpenDirectory =
+      reinterpret_cast<int (*)(const char*, int*)>(files->xGetSystemCall(files, "openDirectory"));
+  const auto unlink = +[](const char* path) {
+    calls.emplace_back("unlink");
+    return realUnlink(path);
+  };
+  const auto openDirectory = +[](const char* path, int* folder) {
+    calls.emplace_back("open folder to sync it");
+    return realOpenDirectory(path, folder);
+  };
+  files->xSetSystemCall(files, "unlink", reinterpret_cast<sqlite3_syscall_ptr>(unlink));
+  files->xSetSystemCall(files, "openDirectory", reinterpret_cast<sqlite3_syscall_ptr>(openDirectory));
+  EXPECT_EQ(remap(), "success");
+  files->xSetSystemCall(files, "unlink", nullptr);
+  files->xSetSystemCall(files, "openDirectory", nullptr);
+  ASSERT_FALSE(calls.empty());
+  EXPECT_EQ(std::count(calls.begin(), calls.end(), "unlink"), 1);
+  EXPECT_EQ(calls.back(), "open folder to sync it");
 }
 
 TEST_F(SqliteContactsTest, IdentifiersAreTextsAndNeverPartOfAStatement) {

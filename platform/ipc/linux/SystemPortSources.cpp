@@ -183,6 +183,8 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
     const bool isDoor = owner_ != nullptr && owner_->isDoor();
     for (int taken = 0; taken < kMessageBudget && pending_ == nullptr && owner_ != nullptr; ++taken) {
       if (isDoor && !owner_->mayBeRead(*this)) {
+        // Who has gone does not wait for an answer, nor keep the place of one who does.
+        if ((events & (EPOLLHUP | EPOLLERR)) != 0) return end();
         isLimited_ = true;
         return pause();
       }

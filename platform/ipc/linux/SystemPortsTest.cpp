@@ -1365,6 +1365,24 @@ TEST_F(ServiceTest, AnAccountThatIsRefusedTooOftenWaitsAndIsThenAnswered) {
   EXPECT_EQ(answer->code(), 0) << "who may come in comes in";
 }
 
+TEST_F(ServiceTest, WhoeverHasGoneDoesNotKeepAPlaceUntilItsAccountMayBeRefusedAgain) {
+  listen();
+  table.refuseWith = kern::invalidSecurity;
+  const UniqueFd connection = connect();
+  do {
+    ASSERT_TRUE(sendTo(connection.get(), message(kRefuse)));
+    pump();
+  } while (receiveFrom(connection.get()));
+  ports.closing().drain();
+  const std::size_t before = openDescriptors();
+  for (int i = 0; i < 30; ++i) ASSERT_TRUE(sendTo(connect().get(), message(kRefuse)));
+  pump();
+  (void)loop->run(200ms, ReturnAfterSource::yes);  // all that wait are looked at again
+  pump();
+  ports.closing().drain();
+  EXPECT_EQ(openDescriptors(), before);
+}
+
 TEST_F(ServiceTest, AClientTakesTwoDescriptors) {
   listen();
   const std::size_t before = openDescriptors();

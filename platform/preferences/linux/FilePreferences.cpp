@@ -63,8 +63,8 @@ std::string machineId(int* failure) {
   return isId ? id : std::string();
 }
 
-void keepKnown(std::string& known, std::string& found) {
-  if (known.empty()) known = std::move(found);
+void keepKnown(std::string& known, std::string& found) noexcept {
+  if (!known.empty()) found = std::move(known);
 }
 
 }  // namespace
@@ -213,13 +213,13 @@ void FilePreferences::lookUpPlaces(UserScope user, HostScope host) {
                        !(host == HostScope::currentHost && places_->machineId.empty());
   if (isKnown) return;
   Places found = askForPlaces_();
-  if (!places_) places_.emplace();
-  // What was found once stays, even if this look-up failed.
-  keepKnown(places_->home, found.home);
-  keepKnown(places_->anyUser, found.anyUser);
-  keepKnown(places_->machineId, found.machineId);
-  places_->homeError = found.homeError;
-  places_->machineIdError = found.machineIdError;
+  if (places_) {
+    // What was found once stays, even if this look-up failed.
+    keepKnown(places_->home, found.home);
+    keepKnown(places_->anyUser, found.anyUser);
+    keepKnown(places_->machineId, found.machineId);
+  }
+  places_ = std::move(found);
 }
 
 std::optional<DomainPlace> FilePreferences::placeOf(std::string_view domain, UserScope user, HostScope host) {
