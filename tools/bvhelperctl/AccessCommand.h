@@ -9,9 +9,9 @@
 
 namespace brenvik::tools {
 
-// "access": goes through the entitlement files with the helper's own code and shows each step. Needs no helper.
-// The outcome's status is `done` when the caller would be let in, `refused` when it would not, and `failed` when
-// that cannot be told. Throws UsageError.
+// "access": goes through the entitlement files with the helper's own code and shows each step. Needs no
+// helper. The outcome's status is `done` when the caller would be let in, `refused` when it would not, and
+// `failed` when that cannot be told. Throws UsageError.
 Outcome explainAccess(const Values& values);
 
 // The same with the files of other directories.

@@ -54,9 +54,8 @@ std::string answer(StandIn& standIn, const bvmh_event& event, const EventStreamO
 }
 
 ExitStatus cannotListen(const EventStreamOptions& options, const StandIn& standIn) {
-  printFailure(options.program, options.asJson,
-               "cannot listen " + standIn.place() + ": " + standIn.reason(), "",
-               nlohmann::ordered_json::object());
+  printFailure(options.program, options.asJson, "cannot listen " + standIn.place() + ": " + standIn.reason(),
+               "", nlohmann::ordered_json::object());
   return ExitStatus::failed;
 }
 

@@ -36,8 +36,8 @@ class StandIn {
   StandIn& operator=(const StandIn&) = delete;
   ~StandIn();
 
-  // Listens for BVMH_PUSHES, BVMH_NOTIFICATIONS or both. An empty directory stands for the sockets that a service
-  // manager handed over, else for the place compiled in. False: reason() says why.
+  // Listens for BVMH_PUSHES, BVMH_NOTIFICATIONS or both. An empty directory stands for the sockets that a
+  // service manager handed over, else for the place compiled in. False: reason() says why.
   bool listen(const std::string& directory, unsigned services, std::optional<std::uint32_t> helperUid);
   enum class Came : std::uint8_t { event, nothing, interrupt, failure };
   // Waits for the next event, which bvmh_event_free frees; `nothing` after `milliseconds` (-1: never).

@@ -561,7 +561,6 @@ class NoDescriptors {
   std::vector<UniqueFd> taken_;
 };
 
-
 constexpr std::size_t kReservedQueues = SystemQueues::kReservedDescriptors / EventLoop::kDescriptors;
 
 TEST_F(SystemQueuesTest, WithoutDescriptorsQueuesLiveOnTheReserveAndGetThreadsOfTheirOwn) {
