@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 #include <sched.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <sys/wait.h>
@@ -335,6 +336,44 @@ TEST_F(CarrierOperationsTest, CopyCarrierFileThatKeepsTheOldFileIsNoSuccessAndWr
       (std::vector{
           Log::bsdLine(SyslogPriority::notice, "'" + elsewhere.path() + "', '" + bundles("") + "', 'file'\n"),
           Log::unifiedLine(LogLevel::info, "Allowing path " + old + " within " + bundles("/"))}));
+}
+
+// Has no descriptor left from the first question about an item until it is to copy one; that fails for
+// another reason.
+class ShortOfDescriptors final : public FaultyFileManager {
+ public:
+  explicit ShortOfDescriptors(FileManager& real) : FaultyFileManager(real) {
+    ::getrlimit(RLIMIT_NOFILE, &limit_);
+  }
+  ~ShortOfDescriptors() { ::setrlimit(RLIMIT_NOFILE, &limit_); }
+  bool itemExists(const std::string& path, bool* isDirectory) noexcept override {
+    rlimit none = limit_;
+    none.rlim_cur = 0;
+    if (!hasCopied_) ::setrlimit(RLIMIT_NOFILE, &none);
+    return FaultyFileManager::itemExists(path, isDirectory);
+  }
+  FileOutcome copyItem(const std::string&, const std::string&, IfPresent, Durability) noexcept override {
+    hasCopied_ = true;
+    ::setrlimit(RLIMIT_NOFILE, &limit_);
+    return FileOutcome::failure(EIO);
+  }
+
+ private:
+  rlimit limit_{};
+  bool hasCopied_ = false;
+};
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileThatCannotTellWhatStoodThereIsNoSuccess) {
+  elsewhere.file("file", "new");
+  const std::string old = home.file("Library/Carrier Bundles/file", "old");
+  ShortOfDescriptors few(real);
+  CarrierOperations withFew{FileSystemManager::factory(few), archive.factory(), policy, preferences,
+                            [this] { return account; }};
+  EXPECT_EQ(withFew.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                    Short("file").data(), &success),
+            0);
+  EXPECT_EQ(success, 0);
+  EXPECT_EQ(contentOf(old), "old");
 }
 
 TEST_F(CarrierOperationsTest, CopyCarrierFileOfWhatIsNoFileOverAFileIsNoSuccess) {

@@ -11,7 +11,7 @@
 namespace brenvik {
 
 // A real file manager that fails where a test asks for it, and remembers what it was asked to do.
-class FaultyFileManager final : public FileManager {
+class FaultyFileManager : public FileManager {
  public:
   explicit FaultyFileManager(FileManager& real) : real_(real) {}
 
