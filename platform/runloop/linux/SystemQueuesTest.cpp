@@ -561,7 +561,6 @@ class NoDescriptors {
   std::vector<UniqueFd> taken_;
 };
 
-
 constexpr std::size_t kReservedQueues = SystemQueues::kReservedDescriptors / EventLoop::kDescriptors;
 
 TEST_F(SystemQueuesTest, WithoutDescriptorsQueuesLiveOnTheReserveAndGetThreadsOfTheirOwn) {
@@ -604,6 +603,14 @@ TEST_F(SystemQueuesTest, WithoutADescriptorForTheClockATimerIsNotMadeAndTheNextO
   const auto timer = loop->addTimer(0s, 0s, [&] { fired = true; }, {});
   EXPECT_NE(timer, nullptr);
   runUntil([&] { return fired; });
+}
+
+TEST_F(SystemQueuesTest, WithoutADescriptorForTheClockATaskThatCannotBePutOffRunsAtOnce) {
+  SystemQueues queues(*loop);
+  const NoDescriptors none;
+  bool ran = false;
+  queues.main().postAfter(1h, [&] { ran = true; });
+  EXPECT_TRUE(ran) << "too early is better than never";
 }
 
 // From now on this process can start neither thread nor process.
