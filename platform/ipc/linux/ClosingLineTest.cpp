@@ -130,6 +130,20 @@ TEST(ClosingLineTest, ASocketThatLingersForAnHourHoldsUpNobody) {
   EXPECT_LT(Clock::now() - started, 60s) << "both are interrupted";
 }
 
+TEST(ClosingLineTest, AnAccountsNextJobWaitsForItsFirstAndKeepsNoThread) {
+  ClosingLine line;
+  const auto started = Clock::now();
+  auto [kept, given] = pair();
+  Lingering first;
+  const int number = first.socket.get();
+  line.close(std::move(first.socket), 1);
+  while (::fcntl(number, F_GETFD) >= 0) std::this_thread::yield();  // the number goes before the waiting
+  line.close(std::move(given), 1);
+  line.drain();
+  EXPECT_TRUE(hasHungUp(kept));
+  EXPECT_GT(Clock::now() - started, 50ms) << "nothing lingered";
+}
+
 TEST(ClosingLineTest, AFullLineTakesNoMoreAndClosesOnTheCallersThread) {
   ClosingLine line;
   EXPECT_TRUE(line.hasRoomFor(ClosingLine::kCapacity));
