@@ -376,6 +376,27 @@ TEST_F(CarrierOperationsTest, CopyCarrierFileSucceedsOnlyWhenTheFileIsOnTheDisk)
   EXPECT_EQ(success, 0);
 }
 
+TEST_F(CarrierOperationsTest, CopyCarrierFileWaitsForTheDiskBeforeTheFileIsShown) {
+  elsewhere.file("file", "content");
+  for (int i = 0; i < 2; ++i) {  // a new file, and one over another
+    (void)operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                     Short("file").data(), &success);
+    EXPECT_EQ(success, 1);
+  }
+  EXPECT_EQ(files.durabilities, std::vector(2, Durability::onReturn));
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileOfADirectoryOntoOneIsAMergeAndSucceeds) {
+  elsewhere.file("name/new", "new");
+  home.file("Library/Carrier Bundles/name/name/old", "old");
+  EXPECT_EQ(operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                       Short("name").data(), &success),
+            0);
+  EXPECT_EQ(success, 1);
+  EXPECT_EQ(contentOf(bundles("/name/name/new")), "new");
+  EXPECT_EQ(contentOf(bundles("/name/name/old")), "old");
+}
+
 TEST_F(CarrierOperationsTest, CopyCarrierFileOntoItselfSucceeds) {
   const std::string file = home.file("Library/Carrier Bundles/file", "kept");
   EXPECT_EQ(operations.copyCarrierFile(kPort, Short(bundles("")).data(), Short(bundles("")).data(),
@@ -420,6 +441,18 @@ TEST_F(CarrierOperationsTest, CopyCrashLogsCopiesIntoTheAccountsCrashLogs) {
   EXPECT_EQ(log.entries(),
             (std::vector{Log::bsdLine(SyslogPriority::notice,
                                       "'" + (elsewhere / "logs") + "', '" + destination + "'\n")}));
+}
+
+TEST_F(CarrierOperationsTest, CopyCrashLogsTakesAHomeThatEndsInASlash) {
+  const std::string slashed = home.path() + "/";
+  account.home = slashed.c_str();
+  const std::string source = elsewhere.directory("logs");
+  home.directory("Library/Logs/CrashReporter");
+  EXPECT_EQ(operations.copyCrashLogs(kPort, Short(source).data(), &success), 0);
+  EXPECT_EQ(success, 1);
+  EXPECT_EQ(log.entries(),
+            (std::vector{Log::bsdLine(SyslogPriority::notice, "'" + source + "', '" + home.path() +
+                                                                  "/Library/Logs/CrashReporter/'\n")}));
 }
 
 TEST_F(CarrierOperationsTest, CopyCrashLogsThatFailsSaysWhyAtNoticeLevel) {
