@@ -159,6 +159,16 @@ TEST_F(LinuxFileManagerTest, OwnersAreKeptWhereThatIsPermitted) {
   EXPECT_EQ(statOf(dir / "copy/file").st_mode & 07777, 04755u);
 }
 
+TEST_F(LinuxFileManagerTest, ATreesFilesOfThisUserKeepAllTheirModeBits) {
+  for (const auto& [name, mode] : {std::pair{"set-id", 06755}, {"sticky", 01644}, {"open", 0666}}) {
+    ASSERT_EQ(::chmod(dir.file(std::string("tree/") + name, "x").c_str(), static_cast<mode_t>(mode)), 0);
+  }
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  EXPECT_EQ(statOf(dir / "copy/set-id").st_mode & 07777, 06755u);
+  EXPECT_EQ(statOf(dir / "copy/sticky").st_mode & 07777, 01644u);
+  EXPECT_EQ(statOf(dir / "copy/open").st_mode & 07777, 0666u);
+}
+
 TEST_F(LinuxFileManagerTest, AnOrdinaryUsersCopyHasNoSetIdBitOfAnotherOwner) {
   const std::string source = dir.file("source", "x");
   ASSERT_EQ(::chmod(dir.path().c_str(), 0777), 0);
