@@ -38,10 +38,13 @@ class StandingItem {
  public:
   explicit StandingItem(const std::string& path)
       : fd_(::open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC)),
-        isThere_(fd_.isValid() && ::fstat(fd_.get(), &info_) == 0) {}
+        isThere_(fd_.isValid() && ::fstat(fd_.get(), &info_) == 0),
+        isKnown_(isThere_ || errno == ENOENT || errno == ENOTDIR) {}
 
-  // Whether the same item stands at the path, or nothing does, as when this object was made.
+  // Whether the same item stands at the path, or nothing does, as when this object was made; or that cannot
+  // be told, for want of a descriptor then.
   bool standsAt(const std::string& path) const {
+    if (!isKnown_) return true;
     struct stat now {};
     if (::lstat(path.c_str(), &now) != 0) return !isThere_;
     return isThere_ && now.st_dev == info_.st_dev && now.st_ino == info_.st_ino;
@@ -51,6 +54,7 @@ class StandingItem {
   const UniqueFd fd_;
   struct stat info_ {};
   const bool isThere_;
+  const bool isKnown_;
 };
 
 }  // namespace

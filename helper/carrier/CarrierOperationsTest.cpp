@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 #include <sched.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <sys/wait.h>
@@ -337,6 +338,44 @@ TEST_F(CarrierOperationsTest, CopyCarrierFileThatKeepsTheOldFileIsNoSuccessAndWr
           Log::unifiedLine(LogLevel::info, "Allowing path " + old + " within " + bundles("/"))}));
 }
 
+// Has no descriptor left from the first question about an item until it is to copy one; that fails for
+// another reason.
+class ShortOfDescriptors final : public FaultyFileManager {
+ public:
+  explicit ShortOfDescriptors(FileManager& real) : FaultyFileManager(real) {
+    ::getrlimit(RLIMIT_NOFILE, &limit_);
+  }
+  ~ShortOfDescriptors() { ::setrlimit(RLIMIT_NOFILE, &limit_); }
+  bool itemExists(const std::string& path, bool* isDirectory) noexcept override {
+    rlimit none = limit_;
+    none.rlim_cur = 0;
+    if (!hasCopied_) ::setrlimit(RLIMIT_NOFILE, &none);
+    return FaultyFileManager::itemExists(path, isDirectory);
+  }
+  FileOutcome copyItem(const std::string&, const std::string&, IfPresent, Durability) noexcept override {
+    hasCopied_ = true;
+    ::setrlimit(RLIMIT_NOFILE, &limit_);
+    return FileOutcome::failure(EIO);
+  }
+
+ private:
+  rlimit limit_{};
+  bool hasCopied_ = false;
+};
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileThatCannotTellWhatStoodThereIsNoSuccess) {
+  elsewhere.file("file", "new");
+  const std::string old = home.file("Library/Carrier Bundles/file", "old");
+  ShortOfDescriptors few(real);
+  CarrierOperations withFew{FileSystemManager::factory(few), archive.factory(), policy, preferences,
+                            [this] { return account; }};
+  EXPECT_EQ(withFew.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                    Short("file").data(), &success),
+            0);
+  EXPECT_EQ(success, 0);
+  EXPECT_EQ(contentOf(old), "old");
+}
+
 TEST_F(CarrierOperationsTest, CopyCarrierFileOfWhatIsNoFileOverAFileIsNoSuccess) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs root to make a device node";
   if (::mknod((elsewhere / "device").c_str(), S_IFCHR | 0666, makedev(1, 3)) != 0)
@@ -374,6 +413,27 @@ TEST_F(CarrierOperationsTest, CopyCarrierFileSucceedsOnlyWhenTheFileIsOnTheDisk)
                                        Short("file").data(), &success),
             0);
   EXPECT_EQ(success, 0);
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileWaitsForTheDiskBeforeTheFileIsShown) {
+  elsewhere.file("file", "content");
+  for (int i = 0; i < 2; ++i) {  // a new file, and one over another
+    (void)operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                     Short("file").data(), &success);
+    EXPECT_EQ(success, 1);
+  }
+  EXPECT_EQ(files.durabilities, std::vector(2, Durability::onReturn));
+}
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileOfADirectoryOntoOneIsAMergeAndSucceeds) {
+  elsewhere.file("name/new", "new");
+  home.file("Library/Carrier Bundles/name/name/old", "old");
+  EXPECT_EQ(operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                       Short("name").data(), &success),
+            0);
+  EXPECT_EQ(success, 1);
+  EXPECT_EQ(contentOf(bundles("/name/name/new")), "new");
+  EXPECT_EQ(contentOf(bundles("/name/name/old")), "old");
 }
 
 TEST_F(CarrierOperationsTest, CopyCarrierFileOntoItselfSucceeds) {
@@ -420,6 +480,18 @@ TEST_F(CarrierOperationsTest, CopyCrashLogsCopiesIntoTheAccountsCrashLogs) {
   EXPECT_EQ(log.entries(),
             (std::vector{Log::bsdLine(SyslogPriority::notice,
                                       "'" + (elsewhere / "logs") + "', '" + destination + "'\n")}));
+}
+
+TEST_F(CarrierOperationsTest, CopyCrashLogsTakesAHomeThatEndsInASlash) {
+  const std::string slashed = home.path() + "/";
+  account.home = slashed.c_str();
+  const std::string source = elsewhere.directory("logs");
+  home.directory("Library/Logs/CrashReporter");
+  EXPECT_EQ(operations.copyCrashLogs(kPort, Short(source).data(), &success), 0);
+  EXPECT_EQ(success, 1);
+  EXPECT_EQ(log.entries(),
+            (std::vector{Log::bsdLine(SyslogPriority::notice, "'" + source + "', '" + home.path() +
+                                                                  "/Library/Logs/CrashReporter/'\n")}));
 }
 
 TEST_F(CarrierOperationsTest, CopyCrashLogsThatFailsSaysWhyAtNoticeLevel) {

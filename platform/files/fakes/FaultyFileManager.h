@@ -11,7 +11,7 @@
 namespace brenvik {
 
 // A real file manager that fails where a test asks for it, and remembers what it was asked to do.
-class FaultyFileManager final : public FileManager {
+class FaultyFileManager : public FileManager {
  public:
   explicit FaultyFileManager(FileManager& real) : real_(real) {}
 
@@ -30,7 +30,8 @@ class FaultyFileManager final : public FileManager {
     partOf_.erase(operation);
   }
 
-  std::vector<std::string> calls;  // "operation path [path]"
+  std::vector<std::string> calls;        // "operation path [path]"
+  std::vector<Durability> durabilities;  // of copyItem and moveItem
   int openScopes = 0;
   int scopesOpened = 0;
 
@@ -48,12 +49,14 @@ class FaultyFileManager final : public FileManager {
   }
   FileOutcome copyItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
                        Durability durability) noexcept override {
+    durabilities.push_back(durability);
     calls.push_back("copyItem " + source + " " + destination);
     if (const FileOutcome* fault = faultOf("copyItem", destination)) return *fault;
     return real_.copyItem(source, destination, ifPresent, durability);
   }
   FileOutcome moveItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
                        Durability durability) noexcept override {
+    durabilities.push_back(durability);
     calls.push_back("moveItem " + source + " " + destination);
     if (const FileOutcome* fault = faultOf("moveItem", destination)) return *fault;
     return real_.moveItem(source, destination, ifPresent, durability);

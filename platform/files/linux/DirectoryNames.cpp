@@ -11,11 +11,11 @@
 
 namespace brenvik {
 
-int DirectoryNames::load(int directory) {
+int DirectoryNames::load(int directory, std::size_t most) {
   packed_.clear();
   position_ = 0;
   alignas(dirent64) char buffer[16384];
-  for (;;) {
+  for (std::size_t count = 0; count < most;) {
     const ssize_t got = ::getdents64(directory, buffer, sizeof buffer);
     if (got < 0) return errno;
     if (got == 0) return 0;
@@ -32,8 +32,10 @@ int DirectoryNames::load(int directory) {
       }
       packed_ += static_cast<char>(type);
       packed_.append(name, std::strlen(name) + 1);
+      ++count;
     }
   }
+  return 0;
 }
 
 bool DirectoryNames::next(Entry* entry) {

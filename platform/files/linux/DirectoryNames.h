@@ -15,9 +15,9 @@ class DirectoryNames {
     unsigned char type;  // DT_* of getdents64(2); DT_UNKNOWN only for what vanished meanwhile
   };
 
-  // Reads all entries but "." and ".." from the directory's current position, usually its start. 0 or errno;
-  // may throw std::bad_alloc.
-  int load(int directory);
+  // Reads all entries but "." and ".." from the directory's current position, usually its start; no more than
+  // a few beyond `most`. 0 or errno; may throw std::bad_alloc.
+  int load(int directory, std::size_t most = static_cast<std::size_t>(-1));
 
   // The next entry; false at the end.
   bool next(Entry* entry);

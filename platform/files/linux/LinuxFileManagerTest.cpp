@@ -28,6 +28,7 @@
 #include "platform/base/UniqueFd.h"
 #include "platform/files/fakes/ChildProcesses.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
+#include "platform/files/linux/DirectoryNames.h"
 
 namespace brenvik {
 namespace {
@@ -157,6 +158,16 @@ TEST_F(LinuxFileManagerTest, OwnersAreKeptWhereThatIsPermitted) {
   EXPECT_EQ(statOf(dir / "copy/file").st_uid, 4711u);
   EXPECT_EQ(statOf(dir / "copy/file").st_gid, 4712u);
   EXPECT_EQ(statOf(dir / "copy/file").st_mode & 07777, 04755u);
+}
+
+TEST_F(LinuxFileManagerTest, ATreesFilesOfThisUserKeepAllTheirModeBits) {
+  for (const auto& [name, mode] : {std::pair{"set-id", 06755}, {"sticky", 01644}, {"open", 0666}}) {
+    ASSERT_EQ(::chmod(dir.file(std::string("tree/") + name, "x").c_str(), static_cast<mode_t>(mode)), 0);
+  }
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  EXPECT_EQ(statOf(dir / "copy/set-id").st_mode & 07777, 06755u);
+  EXPECT_EQ(statOf(dir / "copy/sticky").st_mode & 07777, 01644u);
+  EXPECT_EQ(statOf(dir / "copy/open").st_mode & 07777, 0666u);
 }
 
 TEST_F(LinuxFileManagerTest, AnOrdinaryUsersCopyHasNoSetIdBitOfAnotherOwner) {
@@ -584,6 +595,32 @@ TEST_F(LeftoversTest, InARequestAFolderIsLookedThroughOnce) {
   EXPECT_EQ(copy("tree/file", "third"), kSuccess);
   EXPECT_FALSE(isThere(dir / left));
   files.closeScope();
+}
+
+TEST_F(LeftoversTest, AFolderFullOfThemCostsOneOperationNoMoreThanAThousand) {
+  char name[64];
+  for (int i = 0; i < 1'500; ++i) {
+    (void)std::snprintf(name, sizeof name, "to/.brenvik-%016x", i);
+    ASSERT_EQ(::chmod(dir.directory(name).c_str(), 0700), 0);
+  }
+  EXPECT_EQ(copy("tree/file", "to/file"), kSuccess);
+  EXPECT_EQ(names("to").size(), 501U);
+  EXPECT_EQ(copy("tree/file", "to/more"), kSuccess);
+  EXPECT_EQ(names("to"), (std::vector<std::string>{"file", "more"}));
+}
+
+TEST_F(LeftoversTest, OfAFolderThatSomebodyFilledNotAllIsRead) {
+  for (int i = 0; i < 3'000; ++i) {
+    const std::string path = dir.path() + "/full" + std::to_string(i);
+    ASSERT_GE(UniqueFd(::open(path.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600)).get(), 0);
+  }
+  const UniqueFd folder(::open(dir.path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  DirectoryNames some;
+  ASSERT_EQ(some.load(folder.get(), 1'000), 0);
+  int count = 0;
+  for (DirectoryNames::Entry entry{}; some.next(&entry);) ++count;
+  EXPECT_GE(count, 1'000);
+  EXPECT_LT(count, 3'000);
 }
 
 TEST_F(LeftoversTest, WhatALivingProcessWorksAtIsNotTouched) {

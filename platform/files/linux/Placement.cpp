@@ -43,6 +43,9 @@ namespace {
 constexpr std::string_view kPrefix = ".brenvik-";
 constexpr std::size_t kRoomDigits = 16;
 constexpr int kAttempts = 8;
+// Of what is looked at in one folder: whoever may write there can fill it. The rest waits for another time.
+constexpr std::size_t kMostEntries = 20'000;
+constexpr int kMostHidden = 1'000;
 constexpr int kMostLinks = 40;  // as the kernel follows on one way
 
 using HiddenName = char[48];
@@ -241,10 +244,12 @@ int Place::open(const std::string& path, Place* place) {
 void removeLeftovers(int directory) {
   const UniqueFd here(::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   DirectoryNames names;
-  if (!here.isValid() || names.load(here.get()) != 0) return;
+  if (!here.isValid() || names.load(here.get(), kMostEntries) != 0) return;
+  int hidden = 0;
   for (DirectoryNames::Entry entry{}; names.next(&entry);) {
     const std::string_view name = entry.name;
     if (!name.starts_with(kPrefix)) continue;
+    if (++hidden > kMostHidden) return;
     if (entry.type == DT_DIR && name.size() == kPrefix.size() + kRoomDigits) {
       removeStaleRoom(here.get(), entry.name);
     }

@@ -264,7 +264,19 @@ TEST_F(PlainFileSystemTest, AMoveAcrossWhoseCopyDoesNotReachTheDiskKeepsTheSourc
     EXPECT_EQ(move("tree", "disk/old", IfPresent::replaceNonDirectory), kSuccess);
     EXPECT_EQ(contentOf(dir / "disk/old/file"), "x");
     EXPECT_EQ(names(), (Names{"disk", "single"}));
+    // The last thing on the way: it is there, and may be at its old place again after a power cut.
+    const FailingCall broken("fsync", EIO, 2);
+    EXPECT_EQ(move("single", "disk/single"), FileOutcome::failure(EIO));
+    EXPECT_EQ(broken.failures(), 1);
+    EXPECT_EQ(contentOf(dir / "disk/single"), "s");
+    EXPECT_EQ(names(), (Names{"disk"}));
   });
+}
+
+TEST_F(PlainFileSystemTest, ALinkThatCannotReplaceADirectoryLeavesNoHiddenOne) {
+  dir.file("full/file", "x");
+  EXPECT_EQ(files.placeLink(dir / "full", "target"), FileOutcome::failure(ENOTEMPTY));
+  EXPECT_EQ(names(), (Names{"full"}));
 }
 
 }  // namespace

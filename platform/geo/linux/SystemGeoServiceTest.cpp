@@ -2,9 +2,12 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/geo/linux/SystemGeoService.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <netinet/in.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <condition_variable>
@@ -395,19 +398,50 @@ TEST_F(PublicAddressFinderTest, WithoutAThreadNobodyIsLeftWaitingAndALaterQuesti
   EXPECT_EQ(problems[2], "the name of the STUN server cannot be resolved");
 }
 
-TEST_F(PublicAddressFinderTest, WhereThereIsNoThreadForAnotherTransactionTheOneThatRunsIsShared) {
+TEST_F(PublicAddressFinderTest, WhereThereIsNoThreadForAnotherTransactionTheLastThatBeganIsShared) {
   ManualClock clock;
   ScarceQueues scarce(clock);
   go.set_value();
   const auto finder = make(scarce);
   ask(*finder);
+  ask(*finder);
   scarce.none = true;
   ask(*finder);
-  ASSERT_EQ(scarce.made.size(), 1U);
-  EXPECT_EQ(scarce.made[0]->label(), "geo service: address");
-  scarce.made[0]->real.runReady();
+  ASSERT_EQ(scarce.made.size(), 2U);
+  EXPECT_EQ(scarce.made[1]->label(), "geo service: address");
+  scarce.made[1]->real.runReady();
   EXPECT_EQ(problems, (std::vector<std::string>(2, "the name of the STUN server cannot be resolved")));
   EXPECT_EQ(transactions, 1);
+  scarce.made[0]->real.runReady();
+  EXPECT_EQ(problems.size(), 3U);
+  EXPECT_EQ(transactions, 2);
+}
+
+TEST_F(PublicAddressFinderTest, WithoutDescriptorsTheReserveHoldsItsTransactionsBesideEveryOtherQueue) {
+  untilAllRun = static_cast<int>(PublicAddressFinder::kMostTransactions);
+  const auto finder = make(queues);
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+  const rlimit few{256, before.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &few), 0);
+  std::vector<UniqueFd> all;
+  do {
+    all.emplace_back(::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, 0));
+  } while (all.back().isValid());
+  std::vector<std::shared_ptr<WorkQueue>> others;
+  for (const char* const label :
+       {"GEO callback queue", "geo service: places", "LASDUpdater", "com.norvale.httpdownloadqueue",
+        "HTTP client", "com.norvale.otaheartbeat", "RadioManagerLogs", "global"}) {
+    others.push_back(queues.makeSerial(label, QualityOfService::standard));
+  }
+  for (int i = 0; i < untilAllRun; ++i) ask(*finder);
+  const bool allRun = gone.wait_for(10s) == std::future_status::ready;
+  EXPECT_TRUE(allRun);
+  if (!allRun) go.set_value();
+  EXPECT_TRUE(haveCome(static_cast<std::size_t>(untilAllRun)));
+  EXPECT_EQ(transactions, untilAllRun);
+  finder->stop();
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
 }
 
 }  // namespace

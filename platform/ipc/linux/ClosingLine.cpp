@@ -83,6 +83,20 @@ struct ClosingLine::State {
     return std::find(busy.begin(), busy.end(), account) != busy.end();
   }
 
+  // Whether more accounts have jobs than threads wait for them.
+  bool needsThread() const noexcept {
+    std::array<Account, kMostThreads> seen{};
+    std::size_t count = 0;
+    for (const Job& job : jobs) {
+      if (isBusy(job.account) ||
+          std::find(seen.data(), seen.data() + count, job.account) != seen.data() + count)
+        continue;
+      if (count == threads - busy.size()) return true;
+      seen[count++] = job.account;
+    }
+    return false;
+  }
+
   mutable std::mutex mutex;
   std::condition_variable jobCame;
   std::condition_variable jobDone;
@@ -120,8 +134,7 @@ bool ClosingLine::State::push(Job&& job) noexcept {
 void ClosingLine::State::startThread(const std::shared_ptr<State>& self) noexcept {
   {
     const std::lock_guard lock(mutex);
-    // A thread that waits for work will take it.
-    if (jobs.empty() || threads > busy.size() || threads == kMostThreads) return;
+    if (threads == kMostThreads || !needsThread()) return;
     if (threads == 0) {
       struct sigaction action {};
       action.sa_handler = interrupt;

@@ -19,8 +19,8 @@ namespace brenvik {
 //
 // A close that waits is interrupted every 100 ms, which ends a lingering. A file system that does not answer
 // keeps its thread; no account keeps more than one, and an account that keeps one only delays what is its
-// own. Threads start with the first job. Destroying the line waits a moment for what is left, and then leaves
-// it to the end of the process. Members are called from any thread.
+// own, until its jobs fill the line. Threads start with the first job. Destroying the line waits a moment for
+// what is left, and then leaves it to the end of the process. Members are called from any thread.
 class ClosingLine {
  public:
   using SharedFd = std::shared_ptr<const UniqueFd>;

@@ -14,6 +14,9 @@
 #include <cstring>
 #include <thread>
 
+#include "platform/ipc/linux/IncomingMessage.h"
+#include "platform/ipc/linux/SystemPortSpace.h"
+
 namespace brenvik {
 namespace {
 
@@ -31,9 +34,9 @@ bool hasHungUp(const UniqueFd& fd) {
   return ::poll(&state, 1, 0) == 1;
 }
 
-bool send(const UniqueFd& socket, int descriptor) {
+bool send(const UniqueFd& socket, int descriptor, std::size_t bytes = 1) {
   char byte = 'x';
-  iovec io{&byte, 1};
+  iovec io{&byte, bytes};
   alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
   msghdr message{};
   message.msg_iov = &io;
@@ -45,7 +48,7 @@ bool send(const UniqueFd& socket, int descriptor) {
   item->cmsg_type = SCM_RIGHTS;
   item->cmsg_len = CMSG_LEN(sizeof(int));
   std::memcpy(CMSG_DATA(item), &descriptor, sizeof descriptor);
-  return ::sendmsg(socket.get(), &message, 0) == 1;
+  return ::sendmsg(socket.get(), &message, 0) == static_cast<ssize_t>(bytes);
 }
 
 // A TCP socket whose last close waits an hour: what it has sent is never read.
@@ -130,6 +133,19 @@ TEST(ClosingLineTest, ASocketThatLingersForAnHourHoldsUpNobody) {
   EXPECT_LT(Clock::now() - started, 60s) << "both are interrupted";
 }
 
+TEST(ClosingLineTest, AnAccountsNextJobWaitsForItsFirstAndKeepsNoThread) {
+  ClosingLine line;
+  const auto started = Clock::now();
+  auto [kept, given] = pair();
+  Lingering first;
+  const int number = first.socket.get();
+  line.close(std::move(first.socket), 1);
+  while (::fcntl(number, F_GETFD) >= 0) std::this_thread::yield();  // the number goes before the waiting
+  line.close(std::move(given), 1);
+  while (!hasHungUp(kept)) std::this_thread::yield();
+  EXPECT_GT(Clock::now() - started, 50ms) << "it did not wait for the lingering to be interrupted";
+}
+
 TEST(ClosingLineTest, AFullLineTakesNoMoreAndClosesOnTheCallersThread) {
   ClosingLine line;
   EXPECT_TRUE(line.hasRoomFor(ClosingLine::kCapacity));
@@ -142,6 +158,38 @@ TEST(ClosingLineTest, AFullLineTakesNoMoreAndClosesOnTheCallersThread) {
   }
   line.drain();
   for (const auto& [kept, none] : many) EXPECT_TRUE(hasHungUp(kept));
+}
+
+TEST(ClosingLineTest, TwoAccountsThatComeBeforeTheFirstThreadRunsHaveAThreadEach) {
+  ClosingLine line;
+  std::array<Lingering, 8> busy;  // 100 ms each
+  auto [first, lastOfFirst] = pair();
+  auto [second, ofSecond] = pair();
+  for (Lingering& each : busy) line.close(std::move(each.socket), 1);
+  line.close(std::move(lastOfFirst), 1);
+  line.close(std::move(ofSecond), 2);
+  while (!hasHungUp(second)) std::this_thread::yield();
+  EXPECT_FALSE(hasHungUp(first)) << "the second account waited for the first";
+  line.drain();
+}
+
+TEST(ClosingLineTest, WhatAStrangerSendsWithAnEmptyMessageWaitsForNothingOfTheClients) {
+  SystemPortSpace ports;
+  IncomingMessage incoming(ports);
+  std::array<Lingering, 8> busy;  // 100 ms each
+  for (Lingering& each : busy) ports.closing().close(std::move(each.socket), ClosingLine::kClients);
+  auto [clients, last] = pair();
+  ports.closing().close(std::move(last), ClosingLine::kClients);
+
+  auto [sender, receiver] = pair();
+  auto [kept, given] = pair();
+  ASSERT_TRUE(send(sender, given.get(), 0));
+  given.reset();
+  ASSERT_EQ(incoming.peek(receiver.get(), 1), IncomingMessage::Received::endOfChannel);
+  ports.closing().close(std::move(receiver), 1);
+  while (!hasHungUp(kept)) std::this_thread::yield();
+  EXPECT_FALSE(hasHungUp(clients)) << "it was closed in the name of the clients";
+  ports.closing().drain();
 }
 
 }  // namespace

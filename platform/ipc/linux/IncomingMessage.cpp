@@ -35,12 +35,13 @@ bool isPortSocket(int fd) noexcept {
 
 IncomingMessage::~IncomingMessage() { release(false); }
 
-IncomingMessage::Received IncomingMessage::receive(int fd) noexcept { return receive(fd, 0, kControlRoom); }
+IncomingMessage::Received IncomingMessage::receive(int fd) noexcept {
+  return receive(fd, 0, kControlRoom, ClosingLine::kClients);
+}
 
 IncomingMessage::Received IncomingMessage::peek(int fd, ClosingLine::Account account) noexcept {
-  const Received received = receive(fd, MSG_PEEK, kControlRoomOfAStranger);
+  const Received received = receive(fd, MSG_PEEK, kControlRoomOfAStranger, account);
   peeked_ = received == Received::message;
-  account_ = account;
   return received;
 }
 
@@ -51,8 +52,10 @@ bool IncomingMessage::take(int fd) noexcept {
   return true;
 }
 
-IncomingMessage::Received IncomingMessage::receive(int fd, int flags, std::size_t controlRoom) noexcept {
+IncomingMessage::Received IncomingMessage::receive(int fd, int flags, std::size_t controlRoom,
+                                                   ClosingLine::Account account) noexcept {
   release(false);
+  account_ = account;
   iovec io{storage_.bytes.data(), storage_.bytes.size()};
   msghdr message{};
   message.msg_iov = &io;

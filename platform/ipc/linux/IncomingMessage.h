@@ -75,7 +75,7 @@ class IncomingMessage {
   };
   KernelReturn mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept;
 
-  Received receive(int fd, int flags, std::size_t controlRoom) noexcept;
+  Received receive(int fd, int flags, std::size_t controlRoom, ClosingLine::Account account) noexcept;
 
   SystemPortSpace& ports_;
   std::size_t length_ = 0;

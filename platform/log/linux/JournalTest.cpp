@@ -128,6 +128,9 @@ TEST_F(JournalTest, AJournalThatTakesNothingKeepsOneEntryWaitingForAMomentAndNoO
   EXPECT_LT(std::chrono::steady_clock::now() - before, 50s) << "it would be 100 s";
   EXPECT_EQ(receive(), "MESSAGE=x\n");
   EXPECT_TRUE(journal.send(fields)) << "there is room again";
+  const auto full = std::chrono::steady_clock::now();
+  EXPECT_FALSE(journal.send(fields));
+  EXPECT_GT(std::chrono::steady_clock::now() - full, 50ms) << "so it is worth waiting once more";
 }
 
 TEST_F(JournalTest, WithoutADescriptorForItTheEntryIsNotSentAndTheNextOneTriesAgain) {

@@ -245,7 +245,7 @@ class SystemQueues::Maker : public std::enable_shared_from_this<Maker> {
   std::shared_ptr<WorkQueue> global_;
 };
 
-static_assert(SystemQueues::kReservedDescriptors == 9 * EventLoop::kDescriptors,
+static_assert(SystemQueues::kReservedDescriptors == 12 * EventLoop::kDescriptors,
               "as many queues as the helper ever has at a time");
 
 namespace {

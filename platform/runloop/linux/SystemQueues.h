@@ -40,7 +40,7 @@ class SystemRunLoop final : public RunLoop {
 class SystemQueues final : public WorkQueues {
  public:
   // What a process should leave between its soft limit and the hard one.
-  static constexpr unsigned kReservedDescriptors = 27;
+  static constexpr unsigned kReservedDescriptors = 36;
 
   // The run loop must outlive this object.
   explicit SystemQueues(SystemRunLoop& mainLoop);

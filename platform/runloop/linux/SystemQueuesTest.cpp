@@ -605,6 +605,14 @@ TEST_F(SystemQueuesTest, WithoutADescriptorForTheClockATimerIsNotMadeAndTheNextO
   runUntil([&] { return fired; });
 }
 
+TEST_F(SystemQueuesTest, WithoutADescriptorForTheClockATaskThatCannotBePutOffRunsAtOnce) {
+  SystemQueues queues(*loop);
+  const NoDescriptors none;
+  bool ran = false;
+  queues.main().postAfter(1h, [&] { ran = true; });
+  EXPECT_TRUE(ran) << "too early is better than never";
+}
+
 // From now on this process can start neither thread nor process.
 bool forbidThreads() {
   constexpr auto refuse = static_cast<std::uint32_t>(SECCOMP_RET_ERRNO | EAGAIN);

@@ -650,6 +650,22 @@ TEST_F(CurlWebClientTest, TheBodyOfARedirectIsReadUpTo64KiB) {
   expectKind(WebErrorKind::bodyTooLarge, fetch(server.url("/more")));
 }
 
+TEST_F(CurlWebClientTest, TheBodyOfARedirectIsLimitedAsItTravelsAndDecoded) {
+  std::string empty = gzip("").substr(0, 10);  // a body that decodes to nothing, of empty blocks
+  while (empty.size() <= 64 << 10) empty += std::string("\0\0\0\xFF\xFF", 5);
+  const std::string packed = gzip(std::string((64 << 10) + 1, 'x'));
+  HttpsServer server(identity, [&](Connection& connection) {
+    const auto request = connection.readRequest();
+    if (request.starts_with("GET /target ")) return connection.respond("200 OK", "arrived");
+    connection.respond("302 Found\r\nLocation: /target\r\nContent-Encoding: gzip",
+                       request.starts_with("GET /empty ") ? empty : packed);
+  });
+  Options options;
+  options.headers = {{"Accept-Encoding", "gzip"}};
+  expectKind(WebErrorKind::bodyTooLarge, fetch(server.url("/empty"), options));
+  expectKind(WebErrorKind::bodyTooLarge, fetch(server.url("/packed"), options));
+}
+
 TEST_F(CurlWebClientTest, RedirectsThatDoNotEndAreGivenUp) {
   HttpsServer server(identity, [](Connection& connection) {
     connection.readRequest();
