@@ -10,7 +10,7 @@ import tempfile
 import unittest
 
 BUILD = pathlib.Path(os.environ["BRENVIK_BUILD"])
-COMPLETIONS = BUILD / "tools" / "command-pages" / "completions"
+COMPLETIONS = BUILD / "tools" / "command-pages" / "shells"
 GROUPS = ("prefs", "plist", "voicemail", "carrier", "lasd", "location", "labels", "contacts")
 GLOBAL = {"--json", "--timeout", "--socket", "--version", "--help"}
 

@@ -87,6 +87,7 @@ class ProtocolPage(unittest.TestCase):
         self.assertGreaterEqual(len(rows), 9)
         for name, value in rows:
             default = re.search(rf'^set\({name} "([^"]*)"', options, re.M)[1]
+            default = default.removeprefix("${PROJECT_SOURCE_DIR}/")
             self.assertEqual(value.strip("`"), default or "empty", name)
 
 
