@@ -599,10 +599,14 @@ def journal_explains():
     bvhelperctl("carrier", "remove", "/etc/passwd", check=False)
     shown = run("journalctl", "-x", "-t", "BrenvikMobileHelper").stdout
     for text in ("Could not create data representation of dictionary", "The file is missing, cannot be read, or",
-                 "NOT Allowing path /etc/passwd as it isn't within the wild card directories:", "Something was refused",
+                 "NOT Allowing path /etc/passwd as it isn't within the wild card directories:",
+                 "Refused: The path is neither a carrier file nor in the carrier bundles", "refused process",
                  "ArkCopier signaled fatal file error", "The archive is damaged, hostile or no zip archive"):
         expect(text in shown, f"journalctl -x does not show: {text}\n{shown[-3000:]}")
     expect("a-token" not in shown and "Grüße" not in shown, "no token and no value in the log")
+    asked = run("journalctl", "BRENVIK_CALLER_EXE=/usr/bin/bvhelperctl", "BRENVIK_ROUTINE=BVMobileHelperRemoveCarrierFile",
+                "-o", "cat").stdout
+    expect("NOT Allowing path /etc/passwd" in asked, f"who asked for /etc/passwd is not told\n{asked[-2000:]}")
 
 
 def leaves_when_idle_and_comes_back():
