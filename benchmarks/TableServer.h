@@ -44,8 +44,8 @@ class TableServer {
     }
     client_ = UniqueFd(::fcntl(ports_.sendEnd(port)->get(), F_DUPFD_CLOEXEC, 0));
     child_ = ::fork();
+    // This process keeps the receive right, too: giving it up would shut the socket that the other one reads.
     if (child_ == 0) run(port, make);
-    (void)ports_.dropReceiveRight(port);
   }
   TableServer(const TableServer&) = delete;
   TableServer& operator=(const TableServer&) = delete;
