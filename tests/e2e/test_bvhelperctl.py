@@ -4,6 +4,7 @@
 import contextlib
 import datetime
 import errno
+import itertools
 import json
 import os
 import pathlib
@@ -528,9 +529,12 @@ class Terminal(ToolTest):
             return subprocess.run(["tmux", "-L", "bvhelperctl", *arguments], check=True, timeout=60, capture_output=True,
                                   text=True).stdout
 
+        ends = itertools.count()
+
         def shown(*commands):
-            tmux("send-keys", "clear; " + "; ".join(commands) + "; echo the-end", "Enter")
-            eventually(lambda: re.search("^the-end$", tmux("capture-pane", "-p"), re.M), what="the commands' end")
+            end = f"the-end-{next(ends)}"  # an end of its own, for the one before stands there until the screen is cleared
+            tmux("send-keys", "clear; " + "; ".join(commands) + f"; echo {end}", "Enter")
+            eventually(lambda: re.search(f"^{end}$", tmux("capture-pane", "-p"), re.M), 60, what="the commands' end")
             return tmux("capture-pane", "-p"), tmux("capture-pane", "-p", "-e")
 
         plain, coloured = shown(f"{TOOL} frobnicate", f"{TOOL} lasd check --wait --type gsm")
