@@ -3,13 +3,15 @@
 
 /*
  * The smallest telephony daemon that lives with the helper: it takes over the sockets that the service
- * manager made, asks where the phone is, and prints what it is told. It runs under an account of its own.
+ * manager made, asks where the phone is, and prints what it is told. It runs under an account of its own. On
+ * SIGUSR1 it asks again, as a real one would when the phone has moved.
  *
  *   cc brenvikd.c -o brenvikd $(pkg-config --cflags --libs brenvik-mobile-helper)
  */
 #include <brenvik/mobile_helper.h>
 #include <errno.h>
 #include <poll.h>
+#include <signal.h>
 #include <stdio.h>
 #include <string.h>
 
@@ -43,6 +45,13 @@ static void print(const bvmh_event* event) {
   fflush(stdout);
 }
 
+static volatile sig_atomic_t has_moved;
+
+static void on_moved(int number) {
+  (void)number;
+  has_moved = 1;
+}
+
 int main(void) {
   /* Messages are taken from root and from our own account only; the library turns others away. */
   bvmh_listener* listener = NULL;
@@ -55,10 +64,17 @@ int main(void) {
   if (client == NULL) return fail("no client", BVMH_ERROR_NO_MEMORY);
   code = bvmh_connect(client);
   if (code != BVMH_OK) return fail("the helper does not let us in", code);
-  code = BVMobileHelperRequestCountryCodeFromLocation(client, 59.9139, 10.7522);
-  if (code != BVMH_OK) return fail("could not ask where we are", code);
+  struct sigaction action = {.sa_handler = on_moved};
+  sigaction(SIGUSR1, &action, NULL);
+  has_moved = 1;
 
   for (;;) {
+    if (has_moved) {
+      has_moved = 0;
+      /* When the helper has left or was upgraded meanwhile, the library checks in again. */
+      code = BVMobileHelperRequestCountryCodeFromLocation(client, 59.9139, 10.7522);
+      if (code != BVMH_OK) return fail("could not ask where we are", code);
+    }
     /* A real daemon watches this descriptor in its own event loop. */
     struct pollfd ready = {bvmh_listener_fd(listener), POLLIN, 0};
     if (poll(&ready, 1, -1) < 0) {
