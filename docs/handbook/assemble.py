@@ -172,7 +172,8 @@ class Handbook:
         self.write("log-messages.md", "\n".join(lines))
 
     def write_changelog(self):
-        """Releases as the package's changelog has them, without who and when."""
+        """Releases as the package's changelog has them, without who and when. A page called changelog would be compressed
+        by the package's tools."""
         lines = ["# Changelog", ""]
         for line in (self.tree / "debian" / "changelog").read_text().splitlines():
             release = re.match(r"\S+ \(([^)]+)\)", line)
@@ -182,7 +183,7 @@ class Handbook:
                 lines.append(f"- {line[4:]}")
             elif line.startswith("    "):
                 lines.append(f"  {line[4:]}")
-        self.write("changelog.md", "\n".join(lines) + "\n")
+        self.write("releases.md", "\n".join(lines) + "\n")
 
     def write_drawings(self):
         for path in sorted((self.tree / "docs" / "handbook" / "drawings").iterdir()):

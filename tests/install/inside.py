@@ -266,8 +266,7 @@ def stun_server(seen_as):
 # ---- steps, in order -------------------------------------------------------------------------------------------
 
 
-PACKAGES = ("brenvik-mobile-helper", "brenvik-mobile-helper-data", "bvhelperctl", "libbrenvik-mobile-helper0",
-            "libbrenvik-mobile-helper-dev")
+PACKAGES = sorted({os.path.basename(each).split("_")[0] for each in glob.glob("/packages/*_*.deb")})
 # What is there before the packages come. What the package manager, accounts and the journal write is theirs.
 BEFORE = set()
 NOT_THE_PACKAGES_OWN = ("/proc", "/sys", "/dev", "/run", "/tmp", "/out", "/test", "/packages", "/var/lib/dpkg", "/var/log",
@@ -568,6 +567,13 @@ def commands_of(page):
         return [line.strip() for line in lines if line.startswith("    ")]
 
 
+def the_handbook_is_whole():
+    pages = glob.glob("/usr/share/doc/brenvik-mobile-helper-doc/html/**", recursive=True)
+    expect(any(each.endswith("/integrate.html") for each in pages), f"no handbook: {pages}")
+    expect_equal([each for each in pages if each.endswith(".gz")], [], "a page that no browser reads")
+    expect_equal([each for each in pages if not os.path.exists(each)], [], "links that lead nowhere")
+
+
 def a_telephony_daemon_without_rights_lives_with_it():
     """The handbook's page "Integrate a telephony daemon", command by command."""
     example = "/usr/share/doc/libbrenvik-mobile-helper-dev/examples/brenvikd"
@@ -798,7 +804,7 @@ def main():
     steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, works_in_its_sandbox,
              stores_no_preference_where_it_would_be_lost, works_for_the_whole_phone,
              asks_the_network, beats_over_the_cellular_link, held_in_its_sandbox,
-             other_accounts_are_told_apart, a_telephony_daemon_without_rights_lives_with_it, journal_explains, leaves_when_idle_and_comes_back,
+             other_accounts_are_told_apart, the_handbook_is_whole, a_telephony_daemon_without_rights_lives_with_it, journal_explains, leaves_when_idle_and_comes_back,
              a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade, remove, purge]
     for step in steps:
         began = time.monotonic()
