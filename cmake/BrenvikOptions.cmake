@@ -12,6 +12,9 @@ option(BRENVIK_COVERAGE "Instrument for line and branch coverage (gcov)" OFF)
 option(BRENVIK_WERROR "Warnings are errors. On for us; a packager, whose compiler may be newer, switches it off" ON)
 option(BRENVIK_CLIENT_ONLY "Build the client library alone: it needs a compiler and nothing else" OFF)
 
+option(BRENVIK_BUILD_TOOLS_ONLY "Build the programs that a build runs, and nothing else; a cross build sets it for itself" OFF)
+mark_as_advanced(BRENVIK_BUILD_TOOLS_ONLY)
+
 # The messages are laid out in memory as they travel, and they travel in little-endian order.
 if(CMAKE_CXX_BYTE_ORDER STREQUAL "BIG_ENDIAN")
   message(FATAL_ERROR "BrenvikMobileHelper runs on little-endian machines only; ${CMAKE_SYSTEM_PROCESSOR} is not one.")

@@ -10,10 +10,11 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <string>
 #include <vector>
 
+#include "helper/carrier/FileSystemManager.h"
+#include "platform/files/linux/LinuxFileManager.h"
 #include "platform/ipc/fakes/HeapRegions.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/plist/PropertyListCodec.h"
@@ -341,7 +342,7 @@ TEST_F(PreferenceTransferTest, APathWithoutTerminatorEndsAtItsLastByte) {
   EXPECT_EQ(fileRead, std::string(255, 'p'));
 }
 
-// With real files, outside every carrier directory.
+// Put together as the daemon does it, with real files, outside every carrier directory.
 class PlistFileTest : public PreferenceTransferTest {
  protected:
   PlistFileTest() {
@@ -358,11 +359,9 @@ class PlistFileTest : public PreferenceTransferTest {
   KernelReturn load(std::string_view path) { return fromFiles.loadPlistFile(kPort, Field(path), &payload); }
 
   std::filesystem::path folder;
-  PreferenceTransfer fromFiles{preferences, regions, [](const char* path) {
-                                 std::ifstream in(path, std::ios::binary);
-                                 const std::string bytes{std::istreambuf_iterator<char>(in), {}};
-                                 PropertyList value = parse(bytes);
-                                 return value.is(PropertyList::Type::dictionary) ? value : PropertyList();
+  LinuxFileManager files;
+  PreferenceTransfer fromFiles{preferences, regions, [this](const char* path) {
+                                 return FileSystemManager(files).readDictionary(path);
                                }};
 };
 

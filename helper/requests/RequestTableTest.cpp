@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <array>
 #include <cstring>
 #include <string>
 #include <vector>
@@ -232,43 +233,69 @@ TEST_F(RequestTableTest, TheUpdateChecksReplyLeavesTheNdrRecordToTheSourceOnSucc
   }
 }
 
-TEST_F(RequestTableTest, ArgumentsArriveFromTheirOffsets) {
-  const auto fill = [&](std::size_t offset, std::size_t size, char letter) {
-    std::memset(message + offset, letter, size);
-  };
-  makeRequest(kRequestRoutines[9]);
-  fill(32, 1024, 't');
-  fill(1056, 1024, 'l');
-  fill(2080, 1024, 'd');
-  deliver(kRequestRoutines[9]);
-  EXPECT_EQ(routines.texts,
-            (std::vector{std::string(1024, 't'), std::string(1024, 'l'), std::string(1024, 'd')}));
+// Where each routine's texts stand in its request, as the protocol has them.
+struct TextField {
+  std::size_t offset;
+  std::size_t size;
+};
+const std::array<std::vector<TextField>, 27> kTexts{{
+    {{32, 256}},                               // SetVoicemailToken
+    {{32, 256}, {288, 256}},                   // SetVoicemailTokenForKey
+    {},                                        // ClearVoicemailToken
+    {},                                        // ResetVoicemailStore
+    {{32, 256}},                               // CopyVoicemailTokenForKey
+    {},                                        // CopyVoicemailToken
+    {{52, 256}, {308, 256}},                   // SetPreferenceValue
+    {{32, 256}, {288, 256}},                   // CopyPreferenceValue
+    {{32, 256}, {288, 256}},                   // CopyAppPreferenceValue
+    {{32, 1024}, {1056, 1024}, {2080, 1024}},  // ReplaceCarrierSymlink
+    {{32, 1024}, {1056, 1024}},                // CreateSymlink
+    {{32, 1024}, {1056, 1024}},                // RemoveCarrierFile
+    {},                                        // IsVoicemailServiceSubscribed
+    {},                                        // CellularHeartbeat
+    {},                                        // CheckLASDUpdate
+    {{32, 256}, {288, 256}, {544, 256}},       // CopyCarrierFile
+    {{32, 256}},                               // CopyCrashLogs
+    {{32, 256}, {288, 256}, {544, 256}},       // MoveIntoCarrierBundles
+    {},                                        // RequestCountryCodeFromLocation
+    {},                                        // CopyCountryCode
+    {},                                        // RequestWanIPFromLocation
+    {},                                        // EnableRadioManagerLogs
+    {{32, 256}, {288, 256}},                   // UnpackArchive
+    {{32, 256}},                               // LoadPlistFile
+    {},                                        // CopyBadgeLabels
+    {},                                        // CopyLocalizedLabels
+    {{32, 64}, {96, 64}},                      // RemapContactsChannel
+}};
 
-  makeRequest(kRequestRoutines[15]);
-  fill(32, 256, 's');
-  fill(288, 256, 'd');
-  fill(544, 256, 'n');
-  deliver(kRequestRoutines[15]);
-  EXPECT_EQ(routines.texts,
-            (std::vector{std::string(256, 's'), std::string(256, 'd'), std::string(256, 'n')}));
+TEST_F(RequestTableTest, TextsOfEveryRowArriveInOrderFromTheirOffsets) {
+  for (std::size_t row = 0; row < kRequestRoutines.size(); ++row) {
+    const auto& facts = kRequestRoutines[row];
+    makeRequest(facts);
+    std::vector<std::string> wanted;
+    for (const auto& [offset, size] : kTexts[row]) {
+      const char letter = static_cast<char>('p' + wanted.size());
+      std::memset(message + offset, letter, size);
+      wanted.emplace_back(size, letter);
+    }
+    deliver(facts);
+    EXPECT_EQ(routines.texts, wanted) << facts.name;
+  }
+}
 
-  makeRequest(kRequestRoutines[26]);
-  fill(32, 64, 'f');
-  fill(96, 64, 't');
-  deliver(kRequestRoutines[26]);
-  EXPECT_EQ(routines.texts, (std::vector{std::string(64, 'f'), std::string(64, 't')}));
-
+TEST_F(RequestTableTest, RegionsNumbersAndCoordinatesArriveFromTheirOffsets) {
   makeRequest(kRequestRoutines[6]);
-  fill(52, 256, 'd');
-  fill(308, 256, 'k');
   deliver(kRequestRoutines[6]);
-  EXPECT_EQ(routines.texts, (std::vector{std::string(256, 'd'), std::string(256, 'k')}));
   EXPECT_EQ(routines.firstRegion, "first");
 
-  makeRequest(kRequestRoutines[25]);
-  deliver(kRequestRoutines[25]);
-  EXPECT_EQ(routines.firstRegion, "first");
-  EXPECT_EQ(routines.secondRegion, "other");
+  for (const std::size_t row : {24U, 25U}) {
+    routines.firstRegion.clear();
+    routines.secondRegion.clear();
+    makeRequest(kRequestRoutines[row]);
+    deliver(kRequestRoutines[row]);
+    EXPECT_EQ(routines.firstRegion, "first") << row;
+    EXPECT_EQ(routines.secondRegion, "other") << row;
+  }
 
   makeRequest(kRequestRoutines[18]);
   const double latitude = 59.91;
@@ -279,11 +306,12 @@ TEST_F(RequestTableTest, ArgumentsArriveFromTheirOffsets) {
   EXPECT_EQ(routines.latitude, latitude);
   EXPECT_EQ(routines.longitude, longitude);
 
+  std::int32_t number = -2;
   for (const std::size_t row : {13U, 14U, 21U}) {
     makeRequest(kRequestRoutines[row]);
-    write(32, 0xFFFFFFFE);
+    write(32, static_cast<std::uint32_t>(number));
     deliver(kRequestRoutines[row]);
-    EXPECT_EQ(routines.integer, -2);
+    EXPECT_EQ(routines.integer, number--) << row;
   }
 }
 

@@ -49,6 +49,13 @@ class InstalledTree(unittest.TestCase):
         self.assertEqual(len(found), 1, f"{pattern}: {found}")
         return self.prefix / found[0]
 
+    def test_pkg_config_knows_the_places(self):
+        folder = self.one(r"lib.*/pkgconfig/brenvik-mobile-helper\.pc").parent
+        for variable, option in (("bootstrapdir", "BRENVIK_BOOTSTRAP_DIRECTORY"), ("entitlementdir", "BRENVIK_ENTITLEMENT_DIRECTORIES")):
+            wanted = re.search(rf"^{option}:\w+=(.*)$", self.cache, flags=re.M)[1].split(";")[-1]
+            got = run("pkg-config", f"--variable={variable}", "brenvik-mobile-helper", env={**os.environ, "PKG_CONFIG_LIBDIR": str(folder)})
+            self.assertEqual(got.strip(), wanted)
+
     def test_programs_libraries_and_units_are_there(self):
         for pattern in (r"libexec/brenvik/BrenvikMobileHelper", r"libexec/brenvik/brenvik-archive-reader",
                         r"lib.*/brenvik/brenvik-web\.so", r"bin/bvhelperctl", r"bin/brenvik-standin",
