@@ -198,7 +198,7 @@ TEST_F(LinuxFileManagerTest, HardLinksInsideATreeStayHardLinks) {
   EXPECT_EQ(contentOf(dir / "copy/sub/b"), "shared");
 }
 
-TEST_F(LinuxFileManagerTest, ADirectoryOfManyFilesIsCopiedWholeByTwoThreads) {
+TEST_F(LinuxFileManagerTest, ADirectoryOfManyFilesIsCopiedWhole) {
   std::set<std::string> expected;
   for (int i = 0; i < 500; ++i) {
     const std::string name = "f" + std::to_string(i);
@@ -214,8 +214,8 @@ TEST_F(LinuxFileManagerTest, ADirectoryOfManyFilesIsCopiedWholeByTwoThreads) {
   EXPECT_EQ(names("copy").size(), 501u);
 }
 
-// Directories enough for two threads, one in the other and side by side.
-class LinuxFileManagerTwoThreadsTest : public LinuxFileManagerTest {
+// Many directories, one in the other and side by side.
+class LargeTreeTest : public LinuxFileManagerTest {
  protected:
   static constexpr int kDirectories = 24;
   static constexpr int kFilesEach = 40;
@@ -223,7 +223,7 @@ class LinuxFileManagerTwoThreadsTest : public LinuxFileManagerTest {
   static std::string directoryName(int i) {
     return "tree/" + std::string(i % 3 == 0 ? "" : "deep/er/") + std::to_string(i);
   }
-  LinuxFileManagerTwoThreadsTest() {
+  LargeTreeTest() {
     for (int i = 0; i < kDirectories; ++i) {
       for (int k = 0; k < kFilesEach; ++k) {
         const std::string name = directoryName(i) + "/" + std::to_string(k);
@@ -231,7 +231,7 @@ class LinuxFileManagerTwoThreadsTest : public LinuxFileManagerTest {
       }
       dir.link(directoryName(i) + "/link", std::to_string(i));
     }
-    // Names of one file in two directories, so that each thread may meet one first.
+    // Names of one file in two directories.
     for (int i = 0; i + 1 < kDirectories; i += 2) {
       const std::string first = dir / (directoryName(i) + "/7");
       EXPECT_EQ(::link(first.c_str(), (dir / (directoryName(i + 1) + "/again")).c_str()), 0);
@@ -243,12 +243,12 @@ class LinuxFileManagerTwoThreadsTest : public LinuxFileManagerTest {
     setTimes(dir / "tree", 3000, 5000);
   }
   // An ordinary user removes nothing from a directory closed to writing.
-  ~LinuxFileManagerTwoThreadsTest() override {
+  ~LargeTreeTest() override {
     for (int i = 0; i < kDirectories; ++i) (void)::chmod((dir / directoryName(i)).c_str(), 0755);
   }
 };
 
-TEST_F(LinuxFileManagerTwoThreadsTest, ATreeOfManyDirectoriesIsCopiedWithEverythingAndRemoved) {
+TEST_F(LargeTreeTest, ATreeOfManyDirectoriesIsCopiedWithEverythingAndRemoved) {
   EXPECT_EQ(copy("tree", "copy"), kSuccess);
   for (int i = 0; i < kDirectories; ++i) {
     const std::string from = directoryName(i);
@@ -275,7 +275,7 @@ TEST_F(LinuxFileManagerTwoThreadsTest, ATreeOfManyDirectoriesIsCopiedWithEveryth
   EXPECT_EQ(names(""), (std::vector<std::string>{"tree"}));
 }
 
-TEST_F(LinuxFileManagerTwoThreadsTest, OnAFullDiskNothingOfTheTreeStaysAndTheSourceIsWhole) {
+TEST_F(LargeTreeTest, OnAFullDiskNothingOfTheTreeStaysAndTheSourceIsWhole) {
   dir.directory("disk");
   inPrivateMounts([&] {
     for (const int kibibytes : {200, 1000, 2500, 3500}) {  // it takes 4 KiB a file, and some
@@ -290,7 +290,7 @@ TEST_F(LinuxFileManagerTwoThreadsTest, OnAFullDiskNothingOfTheTreeStaysAndTheSou
   });
 }
 
-TEST_F(LinuxFileManagerTwoThreadsTest, AMoveToAnotherMountTakesEverything) {
+TEST_F(LargeTreeTest, AMoveToAnotherMountTakesEverything) {
   dir.directory("disk");
   inPrivateMounts([&] {
     mountSmallDisk(dir / "disk", 16 << 10);
@@ -305,7 +305,7 @@ TEST_F(LinuxFileManagerTwoThreadsTest, AMoveToAnotherMountTakesEverything) {
   EXPECT_FALSE(isThere(dir / "tree"));
 }
 
-TEST_F(LinuxFileManagerTwoThreadsTest, WhatCannotBeRemovedIsPassedOverAndItsDirectoriesStay) {
+TEST_F(LargeTreeTest, WhatCannotBeRemovedIsPassedOverAndItsDirectoriesStay) {
   if (::geteuid() != 0) GTEST_SKIP() << "mounts on what it removes";
   inPrivateMounts([&] {
     const std::string held = dir / (directoryName(5) + "/7");

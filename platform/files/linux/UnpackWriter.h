@@ -56,7 +56,7 @@ class UnpackWriter final : public ArchiveFrameSink {
   const UnpackOptions options_;
   const std::uint64_t mostBytes_;
   const std::function<int(const ArchiveFileError&)> onFileError_;
-  mode_t umask_ = 0777;
+  const mode_t umask_;
 
   std::uint64_t entries_ = 0;
   std::uint64_t bytes_ = 0;

@@ -95,9 +95,11 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
   if (!isOn(options, "extractPKZip")) return ENOTSUP;
   const auto deadline = std::chrono::steady_clock::now() + longest_;
   // O_NONBLOCK: a FIFO would hold the main loop until somebody writes.
-  const UniqueFd input(::open(archive.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  UniqueFd input;
   struct stat info {};
-  if (!input.isValid() || ::fstat(input.get(), &info) != 0) return errno;
+  if (const int error = openToRead(archive, O_RDONLY | O_NONBLOCK | O_NOCTTY, &input); error != 0)
+    return error;
+  if (::fstat(input.get(), &info) != 0) return errno;
   if (!S_ISREG(info.st_mode)) return EINVAL;
 
   // Beside a destination that is still to be made, or inside one that is there: on its file system either
