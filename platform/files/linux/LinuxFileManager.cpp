@@ -104,15 +104,22 @@ int apply(const ItemAttributes& attributes, int item, bool isLink) {
   return ::chmod(self, *attributes.mode & 07777) == 0 ? 0 : errno;
 }
 
-// Opens an item to change it. `folder`: of the directory it was found in, as it is or as it was. 0 or errno.
-int openToChange(int directory, const char* name, const struct stat& folder, UniqueFd* item,
-                 struct stat* info) {
+bool has(const struct stat& info, const ItemAttributes& attributes) {
+  return attributes.uid.value_or(info.st_uid) == info.st_uid &&
+         attributes.gid.value_or(info.st_gid) == info.st_gid &&
+         (S_ISLNK(info.st_mode) || attributes.mode.value_or(info.st_mode & 07777) == (info.st_mode & 07777));
+}
+
+// Opens an item to give it the attributes. `folder`: of the directory it was found in, as it is or as it was.
+// 0 or errno.
+int openToChange(int directory, const char* name, const struct stat& folder, const ItemAttributes& attributes,
+                 UniqueFd* item, struct stat* info) {
   item->reset(::openat(directory, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
   if (!item->isValid() || ::fstat(item->get(), info) != 0) return errno;
   // Whoever may write in a directory can put a second name of somebody else's file into it.
   const bool hasOtherNames = !S_ISDIR(info->st_mode) && info->st_nlink > 1;
   const bool isFromElsewhere = info->st_uid != folder.st_uid || (folder.st_mode & 0022) != 0;
-  return hasOtherNames && isFromElsewhere ? EPERM : 0;
+  return hasOtherNames && isFromElsewhere && !has(*info, attributes) ? EPERM : 0;
 }
 
 class EnumeratingWalk final : private TreeWalk {
@@ -157,7 +164,7 @@ class ChangingWalk final : private TreeWalk {
  private:
   int visit(Level& level, const DirectoryNames::Entry& entry, bool* descend) override {
     UniqueFd item;
-    int error = openToChange(level.directory.get(), entry.name, level.info, &item, &before_);
+    int error = openToChange(level.directory.get(), entry.name, level.info, attributes_, &item, &before_);
     if (error == 0) error = apply(attributes_, item.get(), S_ISLNK(before_.st_mode));
     if (error != 0) last_ = error;
     *descend = item.isValid() && S_ISDIR(before_.st_mode);
@@ -505,7 +512,8 @@ int LinuxFileManager::change(const std::string& path, const ItemAttributes& attr
   struct stat info {};
   UniqueFd item;
   if (::fstat(place.directory.get(), &folder) != 0) return errno;
-  const int refused = openToChange(place.directory.get(), place.name.c_str(), folder, &item, &info);
+  const int refused =
+      openToChange(place.directory.get(), place.name.c_str(), folder, attributes, &item, &info);
   if (refused != 0) return refused;
   if (kinds == ItemKinds::noFiles && S_ISREG(info.st_mode)) return EINVAL;
   const bool hasBelow = reach == Reach::tree && S_ISDIR(info.st_mode);

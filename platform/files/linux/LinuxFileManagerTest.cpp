@@ -532,6 +532,58 @@ TEST_F(WayTest, ALinkInAFolderThatAnotherAccountMayWriteIsNoWay) {
   expectRefused();
 }
 
+TEST_F(WayTest, ToASourceOnlyOwnLinksLead) {
+  struct Nobody final : ItemVisitor {
+    Next visit(const std::string&, bool) noexcept override { return Next::descend; }
+  } nobody;
+  std::vector<std::string> listed;
+  // Everything that reads by way of folder/link, or lists it.
+  const auto outcomes = [&] {
+    std::filesystem::remove_all(dir / "copied");
+    bool isDirectory = false;
+    const bool exists = files.itemExists(dir / "folder/link/file", &isDirectory);
+    const bool isRead = files.readFile(dir / "folder/link/file", 100) == "kept";
+    return std::vector{copy("folder/link/file", "copied"), exists ? kSuccess : failure(ENOENT),
+                       isRead ? kSuccess : failure(ENOENT),
+                       files.listDirectory(dir / "folder/link/sub", &listed),
+                       files.enumerateBelow(dir / "folder/link", nobody)};
+  };
+  const auto expectAll = [&](const FileOutcome& wanted, const std::string& what) {
+    for (const FileOutcome& outcome : outcomes()) EXPECT_EQ(outcome, wanted) << what;
+  };
+  dir.directory("outside/sub");
+  dir.link("folder/link", dir / "outside");
+  expectAll(kSuccess, "own link in an own folder");
+  for (const mode_t mode : {0775u, 01777u}) {
+    ASSERT_EQ(::chmod((dir / "folder").c_str(), mode), 0);
+    expectAll(kSuccess, "own link that others may move, but that says the same everywhere");
+  }
+  std::filesystem::remove(dir / "folder/link");
+  dir.link("folder/link", "../outside");
+  expectAll(failure(ENOENT), "own link that others may move to where it leads elsewhere");
+  ASSERT_EQ(::chmod((dir / "folder").c_str(), 0755), 0);
+  expectAll(kSuccess, "own link that leads up, in an own folder");
+  if (::geteuid() != 0) return;
+  std::filesystem::remove(dir / "folder/link");
+  ASSERT_EQ(::lchown(dir.link("folder/link", dir / "outside").c_str(), 4711, 4711), 0);
+  expectAll(failure(ENOENT), "a link of somebody else");
+}
+
+TEST_F(WayTest, ASourceThatIsItselfALinkIsCopiedAsALinkAndReadThrough) {
+  dir.directory("outside/sub");
+  const std::string link = dir.link("folder/link", "../outside/sub");
+  const std::string fileLink = dir.link("folder/file", "../outside/file");
+  if (::geteuid() == 0) {
+    ASSERT_EQ(::lchown(link.c_str(), 4711, 4711), 0);
+    ASSERT_EQ(::lchown(fileLink.c_str(), 4711, 4711), 0);
+  }
+  EXPECT_EQ(copy("folder/link", "copied"), kSuccess);
+  EXPECT_EQ(std::filesystem::read_symlink(dir / "copied"), "../outside/sub");
+  EXPECT_EQ(files.readFile(fileLink, 100), "kept");
+  EXPECT_TRUE(files.itemExists(fileLink, nullptr));
+  EXPECT_TRUE(names("folder/link").empty());
+}
+
 // ---- leftovers
 
 class LeftoversTest : public LinuxFileManagerTest {
@@ -992,6 +1044,108 @@ TEST_F(LinuxFileManagerTest, AttributesGoToALinkItselfOrNotAtAll) {
   EXPECT_EQ(files.setAttributes(dir / "missing", {{}, 0, 0}), failure(ENOENT));
   EXPECT_EQ(files.setAttributes(file, {0644, {}, {}}), kSuccess);
   EXPECT_EQ(statOf(file).st_mode & 07777, 0644u);
+}
+
+TEST_F(LinuxFileManagerTest, WhatACopyIsGivenItHasWhenItShows) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give items away";
+  dir.file("file", "x");
+  dir.file("tree/below", "x");
+  dir.link("link", dir / "file");
+  ASSERT_EQ(::mkfifo((dir / "fifo").c_str(), 0600), 0);
+  for (const char* name : {"file", "tree", "link", "fifo"}) {
+    Gift gift{{0640, 4711, 4712}};
+    const std::string copied = dir / (std::string("copied-") + name);
+    EXPECT_EQ(files.copyItem(dir / name, copied, IfPresent::fail, Durability::onReturn, &gift), kSuccess);
+    EXPECT_EQ(gift.outcome, kSuccess) << name;
+    EXPECT_EQ(statOf(copied).st_uid, 4711u) << name;
+    EXPECT_EQ(statOf(copied).st_gid, 4712u) << name;
+    if (std::string_view(name) != "link") {
+      EXPECT_EQ(statOf(copied).st_mode & 07777, 0640u) << name;
+    }
+    EXPECT_EQ(statOf(dir / name).st_uid, 0u) << name;
+    EXPECT_EQ(files.copyItem(dir / name, copied, IfPresent::fail, Durability::eventual, &gift),
+              failure(EEXIST));
+    EXPECT_EQ(gift.outcome, failure(EEXIST)) << name;
+  }
+  EXPECT_EQ(statOf(dir / "copied-tree/below").st_uid, 0u);
+}
+
+TEST_F(LinuxFileManagerTest, OfAKindThatIsNotWantedNothingIsChanged) {
+  const std::string file = dir.file("file");
+  ASSERT_EQ(::chmod(file.c_str(), 0600), 0);
+  EXPECT_EQ(files.setAttributes(file, {0644, {}, {}}, ItemKinds::noFiles), failure(EINVAL));
+  EXPECT_EQ(statOf(file).st_mode & 07777, 0600u);
+  EXPECT_EQ(files.setAttributes(dir.directory("directory"), {0711, {}, {}}, ItemKinds::noFiles), kSuccess);
+  EXPECT_EQ(statOf(dir / "directory").st_mode & 07777, 0711u);
+}
+
+TEST_F(LinuxFileManagerTest, AFileWithFurtherNamesIsChangedOnlyWhereItsOwnerAloneCanHavePutThem) {
+  const std::string elsewhere = dir.file("elsewhere", "x");
+  dir.directory("tree/sub");
+  ASSERT_EQ(::chmod(elsewhere.c_str(), 0600), 0);
+  ASSERT_EQ(::link(elsewhere.c_str(), (dir / "tree/sub/name").c_str()), 0);
+  const auto change = [&](mode_t mode) {
+    return std::pair(files.setAttributesOfTree(dir / "tree", {mode, {}, {}}),
+                     files.setAttributes(dir / "tree/sub/name", {mode, {}, {}}));
+  };
+  EXPECT_EQ(change(0700), std::pair(kSuccess, kSuccess));  // the owner's own folder
+  EXPECT_EQ(statOf(elsewhere).st_mode & 07777, 0700u);
+  ASSERT_EQ(::chmod((dir / "tree/sub").c_str(), 0777), 0);
+  EXPECT_EQ(change(0755).first, failure(EPERM));  // anybody's
+  EXPECT_EQ(statOf(elsewhere).st_mode & 07777, 0700u);
+  EXPECT_EQ(statOf(dir / "tree/sub").st_mode & 07777, 0755u);
+  if (::geteuid() != 0) return;
+  ASSERT_EQ(::chown((dir / "tree/sub").c_str(), 4711, 4711), 0);
+  EXPECT_EQ(change(0750), std::pair(failure(EPERM), failure(EPERM)));  // somebody else's
+  EXPECT_EQ(statOf(elsewhere).st_mode & 07777, 0700u);
+  // A tree of one owner goes with both names of its files.
+  ASSERT_EQ(::chown(elsewhere.c_str(), 4711, 4711), 0);
+  dir.file("tree/sub/one", "x");
+  ASSERT_EQ(::chown((dir / "tree/sub/one").c_str(), 4711, 4711), 0);
+  ASSERT_EQ(::link((dir / "tree/sub/one").c_str(), (dir / "tree/sub/two").c_str()), 0);
+  EXPECT_EQ(files.setAttributesOfTree(dir / "tree", {{}, 0, 0}), kSuccess);
+  EXPECT_EQ(statOf(dir / "tree/sub/one").st_uid, 0u);
+}
+
+TEST_F(LinuxFileManagerTest, OfATreeTheTopsFailureCountsBeforeTheLastOneBelowAndTheRestIsChanged) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to make a file immutable";
+  dir.file("tree/a/stays");
+  dir.file("tree/b/changes");
+  const auto mark = [&](const char* name, int flag) {
+    const UniqueFd item(::open((dir / name).c_str(), O_RDONLY | O_CLOEXEC));
+    return ::ioctl(item.get(), FS_IOC_SETFLAGS, &flag) == 0;
+  };
+  if (!mark("tree/a/stays", FS_IMMUTABLE_FL)) GTEST_SKIP() << "nothing can be made immutable here";
+  EXPECT_EQ(files.setAttributesOfTree(dir / "tree", {{}, 4711, 4711}), failure(EPERM));
+  EXPECT_TRUE(mark("tree/a/stays", 0));
+  EXPECT_EQ(statOf(dir / "tree/a/stays").st_uid, 0u);
+  for (const char* name : {"tree", "tree/a", "tree/b", "tree/b/changes"}) {
+    EXPECT_EQ(statOf(dir / name).st_uid, 4711u) << name;
+  }
+  EXPECT_EQ(files.setAttributesOfTree(dir / "missing", {{}, 0, 0}), failure(ENOENT));
+}
+
+TEST_F(LinuxFileManagerTest, ALinkThatTakesAFoldersPlaceLeadsNoOwnerChangeOutOfTheTree) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give items away";
+  constexpr int kFiles = 50;
+  for (int i = 0; i < kFiles; ++i) dir.file("outside/" + std::to_string(i));
+  for (int i = 0; i < kFiles; ++i) dir.file("tree/sub/" + std::to_string(i));
+  const std::string link = dir.link("link", dir / "outside");
+  const pid_t child = ::fork();
+  if (child == 0) {
+    const std::string folder = dir / "tree/sub";
+    for (;;) (void)::renameat2(AT_FDCWD, folder.c_str(), AT_FDCWD, link.c_str(), RENAME_EXCHANGE);
+  }
+  for (int round = 0; round < 200; ++round) {
+    (void)files.setAttributesOfTree(dir / "tree", {{}, 4711, 4711});
+  }
+  ::kill(child, SIGKILL);
+  ::waitpid(child, nullptr, 0);
+  int foreign = 0;
+  for (int i = 0; i < kFiles; ++i) {
+    if (statOf(dir / ("outside/" + std::to_string(i))).st_uid != 0) ++foreign;
+  }
+  EXPECT_EQ(foreign, 0);
 }
 
 TEST_F(LinuxFileManagerTest, NamedOwnersAreLookedUp) {

@@ -185,6 +185,17 @@ int UnpackWriter::entryData(std::string_view bytes) {
   return skipping_ ? 0 : writeAll(file_.get(), bytes);
 }
 
+UnpackWriter::Room UnpackWriter::roomForData() const {
+  if (skipping_ || !file_.isValid() || entry_.size == archive_frame::kUnknownSize) return {};
+  const std::uint64_t most = std::min(entry_.size - written_, mostBytes_ - std::min(bytes_, mostBytes_));
+  return {file_.get(), static_cast<std::size_t>(most)};
+}
+
+void UnpackWriter::dataWritten(std::size_t bytes) {
+  bytes_ += bytes;
+  written_ += bytes;
+}
+
 int UnpackWriter::entryCompanion(std::string_view bytes) {
   if (const int error = count(bytes.size()); error != 0) return error;
   if (skipping_ || entry_.kind == Kind::link) return 0;

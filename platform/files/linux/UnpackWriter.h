@@ -37,6 +37,14 @@ class UnpackWriter final : public ArchiveFrameSink {
   int entryCompanion(std::string_view bytes) override;
   int endEntry() override;
   int refuseEntry(const std::string& path, int code) override;
+  // Where the current entry's next data may be written to without entryData(), and at most how much of it.
+  struct Room {
+    int file = -1;
+    std::size_t bytes = 0;
+  };
+  Room roomForData() const;
+  // So much has been written there.
+  void dataWritten(std::size_t bytes);
   // After the last entry. 0 or errno.
   int finish();
 
