@@ -49,7 +49,8 @@ struct DirectoryAttributes {
 
 struct ItemAttributes {
   std::optional<mode_t> mode;  // links are passed over
-  std::optional<uid_t> uid;    // of a link itself, never of what it points to
+  std::optional<uid_t>
+      uid;  // of a link itself, never of what it points to; others' links do not become root's
   std::optional<gid_t> gid;
 };
 

@@ -92,11 +92,14 @@ UniqueFd openForNames(int directory) {
 }
 
 // Of the descriptor's own item: `item` may be one of O_PATH, of a link as well. 0 or errno.
-int apply(const ItemAttributes& attributes, int item, bool isLink) {
+int apply(const ItemAttributes& attributes, int item, const struct stat& info) {
+  const bool isLink = S_ISLNK(info.st_mode);
+  const uid_t uid = attributes.uid.value_or(info.st_uid);
+  // A link's owner says who put it there, and root's are followed: somebody else's does not become one of
+  // them.
+  if (isLink && uid != info.st_uid && (uid == 0 || uid == ::geteuid())) return 0;
   if (attributes.uid || attributes.gid) {
-    const uid_t uid = attributes.uid.value_or(static_cast<uid_t>(-1));
-    const gid_t gid = attributes.gid.value_or(static_cast<gid_t>(-1));
-    if (::fchownat(item, "", uid, gid, AT_EMPTY_PATH) != 0) return errno;
+    if (::fchownat(item, "", uid, attributes.gid.value_or(info.st_gid), AT_EMPTY_PATH) != 0) return errno;
   }
   if (!attributes.mode || isLink) return 0;
   char self[32];
@@ -165,7 +168,7 @@ class ChangingWalk final : private TreeWalk {
   int visit(Level& level, const DirectoryNames::Entry& entry, bool* descend) override {
     UniqueFd item;
     int error = openToChange(level.directory.get(), entry.name, level.info, attributes_, &item, &before_);
-    if (error == 0) error = apply(attributes_, item.get(), S_ISLNK(before_.st_mode));
+    if (error == 0) error = apply(attributes_, item.get(), before_);
     if (error != 0) last_ = error;
     *descend = item.isValid() && S_ISDIR(before_.st_mode);
     return 0;
@@ -270,9 +273,10 @@ int LinuxFileManager::stageCopy(const Place& from, struct stat* info, const Plac
   TreeCopier copier(contents(), ::geteuid(), ::getegid(), afterwards);
   const char* const source = from.name.c_str();
   const bool isDirectory = S_ISDIR(info->st_mode);
-  const auto give = [&](int item, bool isLink) {
+  const auto give = [&](int item) {
     if (gift == nullptr) return;
-    const int error = apply(gift->attributes, item, isLink);
+    struct stat made {};
+    const int error = ::fstat(item, &made) != 0 ? errno : apply(gift->attributes, item, made);
     gift->outcome = error == 0 ? FileOutcome::success() : FileOutcome::failure(error);
   };
   if (!isDirectory && !S_ISREG(info->st_mode)) {
@@ -281,7 +285,7 @@ int LinuxFileManager::stageCopy(const Place& from, struct stat* info, const Plac
     const int error = copier.copySpecial(from.directory.get(), source, *info, room, Stage::itemName());
     if (error != 0) return error;
     const UniqueFd made(::openat(room, Stage::itemName(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-    give(made.get(), S_ISLNK(info->st_mode));
+    give(made.get());
     return 0;
   }
   const UniqueFd item(
@@ -297,7 +301,7 @@ int LinuxFileManager::stageCopy(const Place& from, struct stat* info, const Plac
     if (const int error = stage.makeFile(); error != 0) return error;
     if (const int error = copier.copyFileInto(item.get(), *info, stage.get()); error != 0) return error;
   }
-  give(stage.get(), false);
+  give(stage.get());
   if (durability == Durability::eventual) return 0;
   return isDirectory ? syncFileSystem(stage.get()) : syncFile(stage.get());
 }
@@ -518,7 +522,7 @@ int LinuxFileManager::change(const std::string& path, const ItemAttributes& attr
   if (kinds == ItemKinds::noFiles && S_ISREG(info.st_mode)) return EINVAL;
   const bool hasBelow = reach == Reach::tree && S_ISDIR(info.st_mode);
   const int below = hasBelow ? ChangingWalk(attributes).run(item.get(), info) : 0;
-  const int top = apply(attributes, item.get(), S_ISLNK(info.st_mode));
+  const int top = apply(attributes, item.get(), info);
   return top != 0 ? top : below;
 }
 
