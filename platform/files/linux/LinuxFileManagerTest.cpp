@@ -1125,29 +1125,6 @@ TEST_F(LinuxFileManagerTest, OfATreeTheTopsFailureCountsBeforeTheLastOneBelowAnd
   EXPECT_EQ(files.setAttributesOfTree(dir / "missing", {{}, 0, 0}), failure(ENOENT));
 }
 
-TEST_F(LinuxFileManagerTest, ALinkThatTakesAFoldersPlaceLeadsNoOwnerChangeOutOfTheTree) {
-  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give items away";
-  constexpr int kFiles = 50;
-  for (int i = 0; i < kFiles; ++i) dir.file("outside/" + std::to_string(i));
-  for (int i = 0; i < kFiles; ++i) dir.file("tree/sub/" + std::to_string(i));
-  const std::string link = dir.link("link", dir / "outside");
-  const pid_t child = ::fork();
-  if (child == 0) {
-    const std::string folder = dir / "tree/sub";
-    for (;;) (void)::renameat2(AT_FDCWD, folder.c_str(), AT_FDCWD, link.c_str(), RENAME_EXCHANGE);
-  }
-  for (int round = 0; round < 200; ++round) {
-    (void)files.setAttributesOfTree(dir / "tree", {{}, 4711, 4711});
-  }
-  ::kill(child, SIGKILL);
-  ::waitpid(child, nullptr, 0);
-  int foreign = 0;
-  for (int i = 0; i < kFiles; ++i) {
-    if (statOf(dir / ("outside/" + std::to_string(i))).st_uid != 0) ++foreign;
-  }
-  EXPECT_EQ(foreign, 0);
-}
-
 TEST_F(LinuxFileManagerTest, NamedOwnersAreLookedUp) {
   EXPECT_EQ(files.createDirectory(dir / "a", {0755, "root", "root"}, Intermediates::mustExist),
             ::geteuid() == 0 ? kSuccess : failure(EPERM));
