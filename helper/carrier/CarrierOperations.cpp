@@ -2,15 +2,10 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "helper/carrier/CarrierOperations.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <exception>
 #include <string>
 
-#include "platform/base/UniqueFd.h"
 #include "platform/base/Utf8.h"
 #include "platform/log/Log.h"
 
@@ -31,31 +26,6 @@ KernelReturn guarded(KernelReturn onException, Work work) noexcept {
     return onException;
   }
 }
-
-// What stands at a path, links not followed. Holds it, so that nothing new is taken for it: the number of an
-// item that is gone may be given to another.
-class StandingItem {
- public:
-  explicit StandingItem(const std::string& path)
-      : fd_(::open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC)),
-        isThere_(fd_.isValid() && ::fstat(fd_.get(), &info_) == 0),
-        isKnown_(isThere_ || errno == ENOENT || errno == ENOTDIR) {}
-
-  // Whether the same item stands at the path, or nothing does, as when this object was made; or that cannot
-  // be told, for want of a descriptor then.
-  bool standsAt(const std::string& path) const {
-    if (!isKnown_) return true;
-    struct stat now {};
-    if (::lstat(path.c_str(), &now) != 0) return !isThere_;
-    return isThere_ && now.st_dev == info_.st_dev && now.st_ino == info_.st_ino;
-  }
-
- private:
-  const UniqueFd fd_;
-  struct stat info_ {};
-  const bool isThere_;
-  const bool isKnown_;
-};
 
 }  // namespace
 
@@ -127,21 +97,12 @@ KernelReturn CarrierOperations::copyCarrierFile(PortName, char* sourceDirectory,
       return kern::success;
     }
     const std::unique_ptr<FileSystemInterface> fileSystem = fileSystems_();
-    const std::string source = std::string(sourceDirectory) + "/" + fileName;
-    // Onto a directory the file is copied into it.
-    const std::string copied = fileSystem && fileSystem->isDirectory(destination)
-                                   ? destination + "/" + fileSystem->baseName(source)
-                                   : destination;
-    const StandingItem before(copied);
-    if (fileSystem &&
-        fileSystem->copyFileIntoDirectory(sourceDirectory, destinationDirectory, fileName) == 0) {
-      // The copy of a file onto another reports no failure: only a new file at the place tells that it was
-      // made.
-      if (!fileSystem->isDirectory(source) && before.standsAt(copied)) return kern::success;
-      const MobileAccount account = account_();
-      // A link was copied as a link, and is given away as one: what it points to is not ours to give.
-      *success = fileSystem->giveItem(destination, account.uid, account.gid) == 0 &&
-                 fileSystem->syncItem(destination) == 0;
+    const MobileAccount account = account_();
+    bool isGiven = false;
+    // A copied link is given away as a link: what it points to is not ours to give.
+    if (fileSystem && fileSystem->copyFileAndGive(sourceDirectory, destinationDirectory, fileName,
+                                                  account.uid, account.gid, &isGiven) == 0) {
+      *success = isGiven;
     } else {
       logBsd(SyslogPriority::error, "Failed to copy the file %s to %s\n", sourceDirectory,
              destinationDirectory);

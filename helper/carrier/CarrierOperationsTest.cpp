@@ -338,44 +338,6 @@ TEST_F(CarrierOperationsTest, CopyCarrierFileThatKeepsTheOldFileIsNoSuccessAndWr
           Log::unifiedLine(LogLevel::info, "Allowing path " + old + " within " + bundles("/"))}));
 }
 
-// Has no descriptor left from the first question about an item until it is to copy one; that fails for
-// another reason.
-class ShortOfDescriptors final : public FaultyFileManager {
- public:
-  explicit ShortOfDescriptors(FileManager& real) : FaultyFileManager(real) {
-    ::getrlimit(RLIMIT_NOFILE, &limit_);
-  }
-  ~ShortOfDescriptors() { ::setrlimit(RLIMIT_NOFILE, &limit_); }
-  bool itemExists(const std::string& path, bool* isDirectory) noexcept override {
-    rlimit none = limit_;
-    none.rlim_cur = 0;
-    if (!hasCopied_) ::setrlimit(RLIMIT_NOFILE, &none);
-    return FaultyFileManager::itemExists(path, isDirectory);
-  }
-  FileOutcome copyItem(const std::string&, const std::string&, IfPresent, Durability) noexcept override {
-    hasCopied_ = true;
-    ::setrlimit(RLIMIT_NOFILE, &limit_);
-    return FileOutcome::failure(EIO);
-  }
-
- private:
-  rlimit limit_{};
-  bool hasCopied_ = false;
-};
-
-TEST_F(CarrierOperationsTest, CopyCarrierFileThatCannotTellWhatStoodThereIsNoSuccess) {
-  elsewhere.file("file", "new");
-  const std::string old = home.file("Library/Carrier Bundles/file", "old");
-  ShortOfDescriptors few(real);
-  CarrierOperations withFew{FileSystemManager::factory(few), archive.factory(), policy, preferences,
-                            [this] { return account; }};
-  EXPECT_EQ(withFew.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
-                                    Short("file").data(), &success),
-            0);
-  EXPECT_EQ(success, 0);
-  EXPECT_EQ(contentOf(old), "old");
-}
-
 TEST_F(CarrierOperationsTest, CopyCarrierFileOfWhatIsNoFileOverAFileIsNoSuccess) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs root to make a device node";
   if (::mknod((elsewhere / "device").c_str(), S_IFCHR | 0666, makedev(1, 3)) != 0)
@@ -388,9 +350,10 @@ TEST_F(CarrierOperationsTest, CopyCarrierFileOfWhatIsNoFileOverAFileIsNoSuccess)
   EXPECT_EQ(contentOf(old), "old");
 }
 
-TEST_F(CarrierOperationsTest, CopyCarrierFileOntoADirectoryTellsOfTheFileInside) {
+TEST_F(CarrierOperationsTest, CopyCarrierFileOntoADirectoryTellsOfTheFileInsideAndGivesTheDirectory) {
   elsewhere.file("name", "new");
   const std::string inside = home.file("Library/Carrier Bundles/name/name", "old");
+  if (::geteuid() == 0) account.uid = account.gid = 4711;
   const auto copy = [&] {
     (void)operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
                                      Short("name").data(), &success);
@@ -403,16 +366,56 @@ TEST_F(CarrierOperationsTest, CopyCarrierFileOntoADirectoryTellsOfTheFileInside)
   EXPECT_EQ(copy(), 1);
   EXPECT_EQ(contentOf(inside), "new");
   EXPECT_EQ(copy(), 1);  // over a file with the same content
+  EXPECT_EQ(statOf(bundles("/name")).st_uid, account.uid);
+  EXPECT_EQ(statOf(inside).st_uid, ::getuid());
 }
 
-TEST_F(CarrierOperationsTest, CopyCarrierFileSucceedsOnlyWhenTheFileIsOnTheDisk) {
+TEST_F(CarrierOperationsTest, CopyCarrierFileSucceedsOnlyWhenTheDirectoryThatIsGivenIsOnTheDisk) {
   elsewhere.file("file", "content");
-  home.directory("Library/Carrier Bundles");
+  home.directory("Library/Carrier Bundles/file");
   files.fail("syncItem", FileOutcome::failure(EIO));
   EXPECT_EQ(operations.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
                                        Short("file").data(), &success),
             0);
   EXPECT_EQ(success, 0);
+  EXPECT_EQ(contentOf(bundles("/file/file")), "content");
+}
+
+// Puts another file in the place of the copy the moment it is made, as whoever owns the folder can.
+class SwappingFileManager final : public FaultyFileManager {
+ public:
+  using FaultyFileManager::FaultyFileManager;
+  std::string precious;
+  FileOutcome copyItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
+                       Durability durability, Gift* gift) noexcept override {
+    const FileOutcome outcome = FaultyFileManager::copyItem(source, destination, ifPresent, durability, gift);
+    const std::string place = replaces.empty() ? destination : replaces;
+    EXPECT_EQ(::rename(place.c_str(), (place + ".away").c_str()), 0);
+    EXPECT_EQ(::rename(precious.c_str(), place.c_str()), 0);
+    return outcome;
+  }
+  std::string replaces;  // empty: the destination
+};
+
+TEST_F(CarrierOperationsTest, CopyCarrierFileGivesTheCopyAwayAndNeverWhatTakesItsPlace) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give files away";
+  account.uid = account.gid = 4711;
+  for (const bool isDirectory : {false, true}) {
+    SwappingFileManager swapping(real);
+    CarrierOperations withSwaps{FileSystemManager::factory(swapping), archive.factory(), policy, preferences,
+                                [this] { return account; }};
+    const std::string name = isDirectory ? "folder" : "file";
+    elsewhere.file(name, "copied");
+    if (isDirectory) home.directory("Library/Carrier Bundles/folder");
+    swapping.precious = home.file("Library/Carrier Bundles/precious", "root's");
+    if (isDirectory) swapping.replaces = bundles("/folder");
+    (void)withSwaps.copyCarrierFile(kPort, Short(elsewhere.path()).data(), Short(bundles("")).data(),
+                                    Short(name).data(), &success);
+    EXPECT_EQ(success, isDirectory ? 0 : 1);  // of a directory's place it can be seen
+    EXPECT_EQ(contentOf(bundles("/" + name)), "root's");
+    EXPECT_EQ(statOf(bundles("/" + name)).st_uid, 0u);
+    EXPECT_EQ(statOf(bundles("/" + name + ".away")).st_uid, isDirectory ? 0u : 4711u);
+  }
 }
 
 TEST_F(CarrierOperationsTest, CopyCarrierFileWaitsForTheDiskBeforeTheFileIsShown) {

@@ -82,9 +82,11 @@ class FileSystemInterface {
   virtual int placeLink(const std::string& linkPath, const std::string& target) noexcept = 0;
   // A file, a link or an empty directory.
   virtual int removeEntry(const std::string& path) noexcept = 0;
-  virtual int syncItem(const std::string& path) noexcept = 0;
-  // Changes the owner of the item itself: of a link, not of what it points to. Not yet on the disk.
-  virtual int giveItem(const std::string& path, uid_t uid, gid_t gid) noexcept = 0;
+  // As copyFileIntoDirectory, and the copy belongs to this owner before it has its name. Onto a directory the
+  // file is copied into it, and the directory gets the owner. *given: whether something was copied and has
+  // the owner; the result alone does not tell, since a copy onto something reports no failure.
+  virtual int copyFileAndGive(const std::string& sourceDirectory, const std::string& destinationDirectory,
+                              const std::string& name, uid_t uid, gid_t gid, bool* given) noexcept = 0;
 };
 
 // Makes the object of one request; null when memory is exhausted. Called and used on the main thread.

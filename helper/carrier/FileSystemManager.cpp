@@ -66,21 +66,21 @@ FileSystemFactory FileSystemManager::factory(FileManager& files) {
 }
 
 FileOutcome FileSystemManager::transfer(Mode mode, const std::string& source, const std::string& destination,
-                                        IfPresent ifPresent, Durability durability) {
+                                        IfPresent ifPresent, Durability durability, Gift* gift) {
   return mode == Mode::move ? files().moveItem(source, destination, ifPresent, durability)
-                            : files().copyItem(source, destination, ifPresent, durability);
+                            : files().copyItem(source, destination, ifPresent, durability, gift);
 }
 
 int FileSystemManager::copyOrMove(Mode mode, const std::string& source, const std::string& destination,
-                                  uid_t uid, gid_t gid, Durability durability) {
-  struct stat info {};
-  if (::stat(source.c_str(), &info) != 0) return kPosixFailure;
+                                  uid_t uid, gid_t gid, Durability durability, Gift* gift) {
+  bool sourceIsDirectory = false;
+  if (!files().itemExists(source, &sourceIsDirectory)) return kPosixFailure;
   bool destinationIsDirectory = false;
   if (!files().itemExists(destination, &destinationIsDirectory)) {
-    (void)!::chown(source.c_str(), uid, gid);  // an item that cannot be given away is still transferred
-    return transfer(mode, source, destination, IfPresent::fail, durability).codeOr(kUnexplained);
+    (void)files().setAttributes(source, {{}, uid, gid});  // an item that keeps its owner is still transferred
+    return transfer(mode, source, destination, IfPresent::fail, durability, gift).codeOr(kUnexplained);
   }
-  if (!destinationIsDirectory && S_ISDIR(info.st_mode)) return EEXIST;
+  if (!destinationIsDirectory && sourceIsDirectory) return EEXIST;
 
   std::string effective = destination;
   bool gives = true;  // what stands at the effective destination
@@ -90,8 +90,9 @@ int FileSystemManager::copyOrMove(Mode mode, const std::string& source, const st
     bool isDirectoryThere = false;
     gives = files().itemExists(effective, &isDirectoryThere) && !isDirectoryThere;
   }
-  (void)!::chown(source.c_str(), uid, gid);
-  return merge(mode, source, effective, gives ? IfPresent::replaceNonDirectory : IfPresent::fail, durability);
+  (void)files().setAttributes(source, {{}, uid, gid});
+  return merge(mode, source, effective, gives ? IfPresent::replaceNonDirectory : IfPresent::fail, durability,
+               gift);
 }
 
 // Takes the items below the source of a merge to the destination, one by one.
@@ -130,7 +131,7 @@ class FileSystemManager::Merge final : public ItemVisitor {
     const FileOutcome outcome = owner_.transfer(
         mode_, from, to,
         bothExist && !fromIsDirectory && !toIsDirectory ? IfPresent::replaceNonDirectory : IfPresent::fail,
-        Durability::eventual);  // thousands of files: the disk is waited for once, at the end
+        Durability::eventual, nullptr);  // thousands of files: the disk is waited for once, at the end
     if (outcome.succeeded()) return Next::skipBelow;  // a directory came over with all that is in it
     if (lacksMemory(outcome)) lackedMemory_ = true;
     // Below a link the items would be written to wherever it points.
@@ -154,8 +155,8 @@ class FileSystemManager::Merge final : public ItemVisitor {
 
 // 0 whatever fails, but for a lack of memory: then nobody knows what could have been transferred.
 int FileSystemManager::merge(Mode mode, const std::string& source, const std::string& destination,
-                             IfPresent ifPresent, Durability durability) {
-  const FileOutcome whole = transfer(mode, source, destination, ifPresent, durability);
+                             IfPresent ifPresent, Durability durability, Gift* gift) {
+  const FileOutcome whole = transfer(mode, source, destination, ifPresent, durability, gift);
   if (whole.succeeded()) return 0;
   if (lacksMemory(whole)) return ENOMEM;
   bool lackedMemory = false;
@@ -171,8 +172,8 @@ int FileSystemManager::merge(Mode mode, const std::string& source, const std::st
     if (durability == Durability::onReturn)
       (void)files().syncItem(destination);  // a merge reports no failure
   }
-  // Of a copied directory, too: it goes if it is empty.
-  (void)::rmdir(source.c_str());
+  // A copied directory goes as well if it is empty. The slash: nothing but a directory.
+  (void)files().removeEntry(source + "/");
   return lackedMemory ? ENOMEM : 0;
 }
 
@@ -186,8 +187,7 @@ int FileSystemManager::moveItemWithOwner(const std::string& source, const std::s
 }
 
 int FileSystemManager::moveDirectory(const std::string& source, const std::string& destination) noexcept {
-  struct stat info {};
-  if (::stat(source.c_str(), &info) != 0) return kPosixFailure;
+  if (!files().itemExists(source, nullptr)) return kPosixFailure;
   (void)setOwner(source, ::getuid(), ::getgid(), true);  // what keeps its owner is moved all the same
   return files().moveItem(source, destination, IfPresent::fail, Durability::onReturn).codeOr(kUnexplained);
 }
@@ -199,46 +199,47 @@ int FileSystemManager::copyItem(const std::string& source, const std::string& de
 int FileSystemManager::copyFileIntoDirectory(const std::string& sourceDirectory,
                                              const std::string& destinationDirectory,
                                              const std::string& name) noexcept {
+  return copyFile(sourceDirectory, destinationDirectory, name, nullptr);
+}
+
+int FileSystemManager::copyFileAndGive(const std::string& sourceDirectory,
+                                       const std::string& destinationDirectory, const std::string& name,
+                                       uid_t uid, gid_t gid, bool* given) noexcept {
+  *given = false;
+  return guarded(ENOMEM, [&] {
+    const ItemAttributes owner{{}, uid, gid};
+    const std::string destination = destinationDirectory + "/" + name;
+    // Onto a directory the file is copied into it, and the directory is what is given.
+    const bool isInto = isDirectory(destination);
+    Gift gift;
+    if (!isInto) gift.attributes = owner;
+    const int code = copyFile(sourceDirectory, destinationDirectory, name, &gift);
+    if (code != 0) return code;
+    // A copy onto something reports no failure; of a directory it is a merge, which always succeeds.
+    *given = gift.outcome.succeeded() || (isInto && isDirectory(sourceDirectory + "/" + name));
+    // Never a file: somebody can have put another one in the directory's place.
+    if (isInto && *given) {
+      *given = files().setAttributes(destination, owner, ItemKinds::noFiles).succeeded() &&
+               files().syncItem(destination).succeeded();
+    }
+    return 0;
+  });
+}
+
+int FileSystemManager::copyFile(const std::string& sourceDirectory, const std::string& destinationDirectory,
+                                const std::string& name, Gift* gift) noexcept {
   if (!itemExists(destinationDirectory) && createDirectory(destinationDirectory, kDirectoryMode, true) != 0) {
     return kPosixFailure;
   }
   return guarded(ENOMEM, [&] {
     return copyOrMove(Mode::copy, sourceDirectory + "/" + name, destinationDirectory + "/" + name, ::getuid(),
-                      ::getgid(), Durability::onReturn);
+                      ::getgid(), Durability::onReturn, gift);
   });
 }
 
 int FileSystemManager::setAttributesBelow(const std::string& path, const ItemAttributes& attributes) {
-  class Setter final : public ItemVisitor {
-   public:
-    Setter(FileManager& files, const std::string& path, const ItemAttributes& attributes)
-        : files_(files), path_(path), attributes_(attributes) {}
-    Next visit(const std::string& subpath, bool) noexcept override {
-      return guarded(Next::descend, [&] {
-        const FileOutcome outcome = files_.setAttributes(path_ + "/" + subpath, attributes_);
-        if (const int code = outcome.codeOr(0); code != 0) last_ = code;
-        return Next::descend;
-      });
-    }
-    int lastFailure() const { return last_; }
-
-   private:
-    FileManager& files_;
-    const std::string& path_;
-    const ItemAttributes& attributes_;
-    int last_ = 0;
-  };
-
-  bool isDirectoryThere = false;
-  if (!files().itemExists(path, &isDirectoryThere)) return kUnexplained;
-  int below = 0;
-  if (isDirectoryThere) {
-    Setter setter(files(), path, attributes);
-    (void)files().enumerateBelow(path, setter);  // what cannot be listed has no items to set
-    below = setter.lastFailure();
-  }
-  const int top = files().setAttributes(path, attributes).codeOr(0);
-  return top != 0 ? top : below;
+  if (!files().itemExists(path, nullptr)) return kUnexplained;
+  return files().setAttributesOfTree(path, attributes).codeOr(0);
 }
 
 int FileSystemManager::setPermissions(const std::string& path, mode_t mode, bool recursive) noexcept {
@@ -377,14 +378,6 @@ int FileSystemManager::placeLink(const std::string& linkPath, const std::string&
 
 int FileSystemManager::removeEntry(const std::string& path) noexcept {
   return files().removeEntry(path).codeOr(kUnexplained);
-}
-
-int FileSystemManager::syncItem(const std::string& path) noexcept {
-  return files().syncItem(path).codeOr(kUnexplained);
-}
-
-int FileSystemManager::giveItem(const std::string& path, uid_t uid, gid_t gid) noexcept {
-  return files().setAttributes(path, {{}, uid, gid}).codeOr(kUnexplained);
 }
 
 }  // namespace brenvik

@@ -52,8 +52,8 @@ class FileSystemManager final : public FileSystemInterface {
   bool createEmptyFile(const std::string& path) noexcept override;
   int placeLink(const std::string& linkPath, const std::string& target) noexcept override;
   int removeEntry(const std::string& path) noexcept override;
-  int syncItem(const std::string& path) noexcept override;
-  int giveItem(const std::string& path, uid_t uid, gid_t gid) noexcept override;
+  int copyFileAndGive(const std::string& sourceDirectory, const std::string& destinationDirectory,
+                      const std::string& name, uid_t uid, gid_t gid, bool* given) noexcept override;
 
  private:
   enum class Mode { copy, move };
@@ -74,11 +74,13 @@ class FileSystemManager final : public FileSystemInterface {
 
   FileManager& files() const { return scope_.files(); }
   FileOutcome transfer(Mode mode, const std::string& source, const std::string& destination,
-                       IfPresent ifPresent, Durability durability);
+                       IfPresent ifPresent, Durability durability, Gift* gift);
   int copyOrMove(Mode mode, const std::string& source, const std::string& destination, uid_t uid, gid_t gid,
-                 Durability durability = Durability::eventual);
+                 Durability durability = Durability::eventual, Gift* gift = nullptr);
   int merge(Mode mode, const std::string& source, const std::string& destination, IfPresent ifPresent,
-            Durability durability);
+            Durability durability, Gift* gift);
+  int copyFile(const std::string& sourceDirectory, const std::string& destinationDirectory,
+               const std::string& name, Gift* gift) noexcept;
   int setAttributesBelow(const std::string& path, const ItemAttributes& attributes);
 
   const ReleaseScope scope_;

@@ -49,9 +49,20 @@ struct DirectoryAttributes {
 
 struct ItemAttributes {
   std::optional<mode_t> mode;  // links are passed over
-  std::optional<uid_t> uid;    // of a link itself, never of what it points to
+  std::optional<uid_t>
+      uid;  // of a link itself, never of what it points to; others' links do not become root's
   std::optional<gid_t> gid;
 };
+
+// What the item that a copy makes is given before it has its name, so that nothing else can be given away in
+// its place. An item that cannot have the attributes is shown without them.
+struct Gift {
+  ItemAttributes attributes;
+  // Success if the item stands at its place and has the attributes.
+  FileOutcome outcome = FileOutcome::failureWithoutCode();
+};
+
+enum class ItemKinds { all, noFiles };
 
 // Is told of the items below a directory.
 class ItemVisitor {
@@ -67,7 +78,8 @@ class ItemVisitor {
 // extended attributes. Paths are NUL-terminated bytes. A link that is itself the item is copied, moved or
 // removed as a link, and nothing is ever written through one. On the way to what is made, changed or removed,
 // a link is followed only when nobody but root and this account can have put it there; else the operation
-// fails as if the directory were missing. On the way to what is read, links are followed.
+// fails as if the directory were missing. On the way to what is read or copied, root's and this account's own
+// links are followed wherever they stand, unless ".." is in their target.
 //
 // A copy or a move shows at its destination whole or not at all, even when the process is killed. What a
 // killed process leaves is a hidden ".brenvik-" item beside the destination; the next operation in that
@@ -82,15 +94,18 @@ class FileManager {
   virtual void openScope() noexcept = 0;
   virtual void closeScope() noexcept = 0;
 
-  // Whether anything is at the path, links followed; then, if asked, whether it is a directory.
+  // Whether anything is at the path, a link that is itself the item followed; then, if asked, whether it is a
+  // directory.
   virtual bool itemExists(const std::string& path, bool* isDirectory) noexcept = 0;
 
   // Fail with EINVAL when a directory would come to stand inside itself. moveItem is one rename inside a file
   // system; across two it copies, waits until the copy is on the disk, then removes the source. It ends with
   // the item whole at one of the two places: where something in the source cannot be removed (EBUSY: a mount;
   // EPERM: an immutable file; EROFS ...), it stays where it was. A source that ends in "." or ".." is EBUSY.
+  // `gift` may be null.
   virtual FileOutcome copyItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
-                               Durability durability = Durability::eventual) noexcept = 0;
+                               Durability durability = Durability::eventual,
+                               Gift* gift = nullptr) noexcept = 0;
   virtual FileOutcome moveItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
                                Durability durability = Durability::eventual) noexcept = 0;
   // With everything below it.
@@ -115,10 +130,19 @@ class FileManager {
 
   // Calls the visitor for everything below the directory, each directory before what is in it. The names of a
   // directory are read when it is descended into; the visitor may change the tree meanwhile. Links below are
-  // not followed. The failure reported is the first that kept a directory from being read.
+  // not followed, and a link at the path itself counts as one on the way. The failure reported is the first
+  // that kept a directory from being read.
   virtual FileOutcome enumerateBelow(const std::string& path, ItemVisitor& visitor) noexcept = 0;
 
-  virtual FileOutcome setAttributes(const std::string& path, const ItemAttributes& attributes) noexcept = 0;
+  // Changes the very item that it has looked at. With `noFiles`, a regular file is EINVAL. A file with
+  // further names (hard links), which may stand anywhere, is EPERM unless it belongs to the owner of the
+  // directory it was found in and nobody else may write there.
+  virtual FileOutcome setAttributes(const std::string& path, const ItemAttributes& attributes,
+                                    ItemKinds kinds = ItemKinds::all) noexcept = 0;
+  // The same for everything below a directory, then for the item at the path. Goes on past what cannot be
+  // changed. Reports the failure of the item at the path, else the last one below it.
+  virtual FileOutcome setAttributesOfTree(const std::string& path,
+                                          const ItemAttributes& attributes) noexcept = 0;
 
   // The bytes of a regular file, at most `limit` of them; nothing when it is missing, larger, unreadable or
   // not a regular file. Never waits for a writer.

@@ -50,6 +50,7 @@ struct Refusal {
 inline constexpr std::uint64_t kUnknownSize = ~std::uint64_t{0};
 inline constexpr std::int64_t kNoTime = INT64_MIN;
 inline constexpr std::size_t kLongestPath = 1024;
+inline constexpr int kPipe = 1 << 20;                        // bytes that the pipe has room for, at most
 inline constexpr std::uint32_t kLargeChunk = 64 << 10;       // from here on a chunk is written alone
 inline constexpr std::uint32_t kLargestChunk = 1 << 20;      // of data or companion in one frame
 inline constexpr std::uint32_t kLargestCompanion = 4 << 20;  // as much as the reader hands over
@@ -87,6 +88,13 @@ class ArchiveFrameParser {
   int take(std::string_view bytes);
   // How many bytes the next piece should have at most, so that large chunks come in pieces of their own.
   std::size_t bestPiece() const;
+  // How many of the next bytes are a file's data and nothing else.
+  std::size_t dataAhead() const { return inFrame_ && head_.type == archive_frame::Type::data ? left_ : 0; }
+  // So many of them have gone another way, and are neither to be taken nor given to the sink.
+  void pass(std::size_t bytes) {
+    left_ -= static_cast<std::uint32_t>(bytes);
+    inFrame_ = left_ > 0;
+  }
   // The reader has read the archive to its end; no byte may follow.
   bool hasFinished() const { return finished_; }
 

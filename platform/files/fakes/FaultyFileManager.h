@@ -48,11 +48,11 @@ class FaultyFileManager : public FileManager {
     return real_.itemExists(path, isDirectory);
   }
   FileOutcome copyItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
-                       Durability durability) noexcept override {
+                       Durability durability, Gift* gift) noexcept override {
     durabilities.push_back(durability);
     calls.push_back("copyItem " + source + " " + destination);
     if (const FileOutcome* fault = faultOf("copyItem", destination)) return *fault;
-    return real_.copyItem(source, destination, ifPresent, durability);
+    return real_.copyItem(source, destination, ifPresent, durability, gift);
   }
   FileOutcome moveItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
                        Durability durability) noexcept override {
@@ -93,10 +93,17 @@ class FaultyFileManager : public FileManager {
     if (const FileOutcome* fault = faultOf("enumerateBelow", path)) return *fault;
     return real_.enumerateBelow(path, visitor);
   }
-  FileOutcome setAttributes(const std::string& path, const ItemAttributes& attributes) noexcept override {
+  FileOutcome setAttributes(const std::string& path, const ItemAttributes& attributes,
+                            ItemKinds kinds) noexcept override {
     calls.push_back("setAttributes " + path);
     if (const FileOutcome* fault = faultOf("setAttributes", path)) return *fault;
-    return real_.setAttributes(path, attributes);
+    return real_.setAttributes(path, attributes, kinds);
+  }
+  FileOutcome setAttributesOfTree(const std::string& path,
+                                  const ItemAttributes& attributes) noexcept override {
+    calls.push_back("setAttributesOfTree " + path);
+    if (const FileOutcome* fault = faultOf("setAttributesOfTree", path)) return *fault;
+    return real_.setAttributesOfTree(path, attributes);
   }
   std::optional<std::string> readFile(const std::string& path, std::size_t limit) noexcept override {
     return real_.readFile(path, limit);

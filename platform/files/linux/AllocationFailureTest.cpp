@@ -87,7 +87,7 @@ class AllocationFailureTest : public testing::TestWithParam<Which> {
 };
 
 TEST_P(AllocationFailureTest, ACopyIsWholeOrAnswersEnomemAndLeavesNothing) {
-  for (int i = 0; i < 90; ++i) {  // enough for two threads
+  for (int i = 0; i < 90; ++i) {
     dir.file("tree/" + std::to_string(i % 3) + "/" + std::to_string(i), "content");
   }
   dir.link("tree/link", "target");

@@ -16,10 +16,10 @@
 #include "platform/files/linux/DirectoryNames.h"
 #include "platform/files/linux/Durability.h"
 #include "platform/files/linux/FileContents.h"
-#include "platform/files/linux/HeldDirectory.h"
 #include "platform/files/linux/Placement.h"
 #include "platform/files/linux/TreeCopier.h"
 #include "platform/files/linux/TreeRemover.h"
+#include "platform/files/linux/TreeWalk.h"
 
 namespace brenvik {
 namespace {
@@ -86,6 +86,105 @@ bool isDirectory(const std::string& path) {
   struct stat info {};
   return ::stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode);
 }
+
+UniqueFd openForNames(int directory) {
+  return UniqueFd(::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+}
+
+// Of the descriptor's own item: `item` may be one of O_PATH, of a link as well. 0 or errno.
+int apply(const ItemAttributes& attributes, int item, const struct stat& info) {
+  const bool isLink = S_ISLNK(info.st_mode);
+  const uid_t uid = attributes.uid.value_or(info.st_uid);
+  // A link's owner says who put it there, and root's are followed: somebody else's does not become one of
+  // them.
+  if (isLink && uid != info.st_uid && (uid == 0 || uid == ::geteuid())) return 0;
+  if (attributes.uid || attributes.gid) {
+    if (::fchownat(item, "", uid, attributes.gid.value_or(info.st_gid), AT_EMPTY_PATH) != 0) return errno;
+  }
+  if (!attributes.mode || isLink) return 0;
+  char self[32];
+  (void)std::snprintf(self, sizeof self, "/proc/self/fd/%d", item);
+  return ::chmod(self, *attributes.mode & 07777) == 0 ? 0 : errno;
+}
+
+bool has(const struct stat& info, const ItemAttributes& attributes) {
+  return attributes.uid.value_or(info.st_uid) == info.st_uid &&
+         attributes.gid.value_or(info.st_gid) == info.st_gid &&
+         (S_ISLNK(info.st_mode) || attributes.mode.value_or(info.st_mode & 07777) == (info.st_mode & 07777));
+}
+
+// Opens an item to give it the attributes. `folder`: of the directory it was found in, as it is or as it was.
+// 0 or errno.
+int openToChange(int directory, const char* name, const struct stat& folder, const ItemAttributes& attributes,
+                 UniqueFd* item, struct stat* info) {
+  item->reset(::openat(directory, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  if (!item->isValid() || ::fstat(item->get(), info) != 0) return errno;
+  // Whoever may write in a directory can put a second name of somebody else's file into it.
+  const bool hasOtherNames = !S_ISDIR(info->st_mode) && info->st_nlink > 1;
+  const bool isFromElsewhere = info->st_uid != folder.st_uid || (folder.st_mode & 0022) != 0;
+  return hasOtherNames && isFromElsewhere && !has(*info, attributes) ? EPERM : 0;
+}
+
+class EnumeratingWalk final : private TreeWalk {
+ public:
+  explicit EnumeratingWalk(ItemVisitor& visitor) : visitor_(visitor) {}
+  int run(UniqueFd directory) {
+    Level top;
+    top.directory = HeldDirectory(std::move(directory));
+    const int error = walk(std::move(top));
+    return first_ != 0 ? first_ : error;
+  }
+
+ private:
+  int visit(Level&, const DirectoryNames::Entry& entry, bool* descend) override {
+    const bool isDirectory = entry.type == DT_DIR;
+    *descend = visitor_.visit(path(), isDirectory) == ItemVisitor::Next::descend && isDirectory;
+    return 0;
+  }
+  int cannotEnter(Level&, const char*, int error) override {
+    // ENOENT: the visitor took it away, or somebody else did.
+    if (first_ == 0 && error != ENOENT) first_ = error;
+    return 0;
+  }
+
+  ItemVisitor& visitor_;
+  int first_ = 0;
+};
+
+class ChangingWalk final : private TreeWalk {
+ public:
+  explicit ChangingWalk(const ItemAttributes& attributes) : attributes_(attributes) {}
+  // 0, or the last errno.
+  int run(int directory, const struct stat& info) {
+    Level top;
+    top.directory = HeldDirectory(openForNames(directory));
+    top.info = info;
+    if (top.directory.get() < 0) return 0;  // what cannot be listed has no items to change
+    const int error = walk(std::move(top));
+    return error != 0 ? error : last_;
+  }
+
+ private:
+  int visit(Level& level, const DirectoryNames::Entry& entry, bool* descend) override {
+    UniqueFd item;
+    int error = openToChange(level.directory.get(), entry.name, level.info, attributes_, &item, &before_);
+    if (error == 0) error = apply(attributes_, item.get(), before_);
+    if (error != 0) last_ = error;
+    *descend = item.isValid() && S_ISDIR(before_.st_mode);
+    return 0;
+  }
+  int opened(Level&, Level& below) override {
+    if (::fstat(below.directory.get(), &below.info) != 0) return errno;
+    // The owner that it had when its names were put there. Another may stand in its place by now.
+    if (isSameItem(below.info, before_)) below.info = before_;
+    return 0;
+  }
+  int cannotEnter(Level&, const char*, int) override { return 0; }  // as for the top
+
+  const ItemAttributes& attributes_;
+  struct stat before_ {};  // of the last item visited
+  int last_ = 0;
+};
 
 }  // namespace
 
@@ -158,43 +257,61 @@ FileContents& LinuxFileManager::contents() {
 
 bool LinuxFileManager::itemExists(const std::string& path, bool* isDirectory) noexcept {
   struct stat info {};
-  const bool exists = ::stat(path.c_str(), &info) == 0;
+  const bool exists = guarded([&] {
+                        UniqueFd item;
+                        if (const int error = openToRead(path, O_PATH, &item); error != 0) return error;
+                        return ::fstat(item.get(), &info) == 0 ? 0 : errno;
+                      }).succeeded();
   if (isDirectory != nullptr) *isDirectory = exists && S_ISDIR(info.st_mode);
   return exists;
 }
 
 // Makes a copy of the item in the stage, with everything on the disk but its name where that is asked for.
-// *info: of the item; then of what was opened. 0 or errno.
-int LinuxFileManager::stageCopy(int sourceDirectory, const char* source, struct stat* info,
-                                const Place& place, Stage& stage, TreeCopier::Source afterwards,
-                                Durability durability) {
+// *info: of the item; then of what was opened. 0 or errno. Whether the gift was given is its outcome.
+int LinuxFileManager::stageCopy(const Place& from, struct stat* info, const Place& to, Stage& stage,
+                                TreeCopier::Source afterwards, Durability durability, Gift* gift) {
   TreeCopier copier(contents(), ::geteuid(), ::getegid(), afterwards);
-  const bool isDurable = durability == Durability::onReturn;
-  if (S_ISDIR(info->st_mode)) {
-    const UniqueFd from(::openat(sourceDirectory, source, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-    if (!from.isValid() || ::fstat(from.get(), info) != 0) return errno;
-    if (isInside(place.directory.get(), *info)) return EINVAL;
-    if (const int error = stage.makeDirectory(); error != 0) return error;
-    if (const int error = copier.copyDirectoryInto(from.get(), *info, stage.get()); error != 0) return error;
-    return isDurable ? syncFileSystem(stage.get()) : 0;
+  const char* const source = from.name.c_str();
+  const bool isDirectory = S_ISDIR(info->st_mode);
+  const auto give = [&](int item) {
+    if (gift == nullptr) return;
+    struct stat made {};
+    const int error = ::fstat(item, &made) != 0 ? errno : apply(gift->attributes, item, made);
+    gift->outcome = error == 0 ? FileOutcome::success() : FileOutcome::failure(error);
+  };
+  if (!isDirectory && !S_ISREG(info->st_mode)) {
+    if (const int error = stage.makeRoom(); error != 0) return error;
+    const int room = stage.room();
+    const int error = copier.copySpecial(from.directory.get(), source, *info, room, Stage::itemName());
+    if (error != 0) return error;
+    const UniqueFd made(::openat(room, Stage::itemName(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    give(made.get());
+    return 0;
   }
-  if (S_ISREG(info->st_mode)) {
-    const UniqueFd from(
-        ::openat(sourceDirectory, source, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-    if (!from.isValid() || ::fstat(from.get(), info) != 0) return errno;
+  const UniqueFd item(
+      ::openat(from.directory.get(), source,
+               O_RDONLY | O_NOFOLLOW | O_CLOEXEC | (isDirectory ? O_DIRECTORY : O_NONBLOCK | O_NOCTTY)));
+  if (!item.isValid() || ::fstat(item.get(), info) != 0) return errno;
+  if (isDirectory) {
+    if (isInside(to.directory.get(), *info)) return EINVAL;
+    if (const int error = stage.makeDirectory(); error != 0) return error;
+    if (const int error = copier.copyDirectoryInto(item.get(), *info, stage.get()); error != 0) return error;
+  } else {
     if (!S_ISREG(info->st_mode)) return EBUSY;
     if (const int error = stage.makeFile(); error != 0) return error;
-    if (const int error = copier.copyFileInto(from.get(), *info, stage.get()); error != 0) return error;
-    return isDurable ? syncFile(stage.get()) : 0;
+    if (const int error = copier.copyFileInto(item.get(), *info, stage.get()); error != 0) return error;
   }
-  if (const int error = stage.makeRoom(); error != 0) return error;
-  return copier.copySpecial(sourceDirectory, source, *info, stage.room(), Stage::itemName());
+  give(stage.get());
+  if (durability == Durability::eventual) return 0;
+  return isDirectory ? syncFileSystem(stage.get()) : syncFile(stage.get());
 }
 
 int LinuxFileManager::copy(const std::string& source, const std::string& destination, IfPresent ifPresent,
-                           Durability durability) {
+                           Durability durability, Gift* gift) {
+  Place from;
   struct stat info {};
-  if (::lstat(source.c_str(), &info) != 0) return errno;
+  if (const int error = Place::openExisting(source, &from, Links::own); error != 0) return error;
+  if (::fstatat(from.directory.get(), from.name.c_str(), &info, AT_SYMLINK_NOFOLLOW) != 0) return errno;
   Place place;
   if (const int error = openPlace(destination, &place); error != 0) return error;
   struct stat there {};
@@ -202,8 +319,7 @@ int LinuxFileManager::copy(const std::string& source, const std::string& destina
   if (present && (ifPresent == IfPresent::fail || S_ISDIR(there.st_mode))) return EEXIST;
 
   Stage stage(place);
-  const int error =
-      stageCopy(AT_FDCWD, source.c_str(), &info, place, stage, TreeCopier::Source::stays, durability);
+  const int error = stageCopy(from, &info, place, stage, TreeCopier::Source::stays, durability, gift);
   if (error != 0) return error;
   if (const int failed = stage.publish(ifPresent); failed != 0) return failed;
   return durability == Durability::onReturn ? syncNames(place.directory.get()) : 0;
@@ -225,8 +341,7 @@ int LinuxFileManager::moveAcross(const Place& from, const Place& to, IfPresent i
   if (noRoom != 0 && !isFull) return noRoom;
 
   Stage stage(to, Stage::Undo::possible);
-  if (const int error = stageCopy(from.directory.get(), from.name.c_str(), &info, to, stage,
-                                  TreeCopier::Source::goes, Durability::onReturn);
+  if (const int error = stageCopy(from, &info, to, stage, TreeCopier::Source::goes, Durability::onReturn);
       error != 0) {
     return error;
   }
@@ -294,8 +409,10 @@ int LinuxFileManager::move(const std::string& source, const std::string& destina
 }
 
 FileOutcome LinuxFileManager::copyItem(const std::string& source, const std::string& destination,
-                                       IfPresent ifPresent, Durability durability) noexcept {
-  return guarded([&] { return copy(source, destination, ifPresent, durability); });
+                                       IfPresent ifPresent, Durability durability, Gift* gift) noexcept {
+  const FileOutcome outcome = guarded([&] { return copy(source, destination, ifPresent, durability, gift); });
+  if (gift != nullptr && !outcome.succeeded()) gift->outcome = outcome;
+  return outcome;
 }
 
 FileOutcome LinuxFileManager::moveItem(const std::string& source, const std::string& destination,
@@ -338,18 +455,18 @@ FileOutcome LinuxFileManager::placeLink(const std::string& path, const std::stri
 
 FileOutcome LinuxFileManager::syncItem(const std::string& path) noexcept {
   return guarded([&] {
+    Place place;
+    if (const int error = Place::openExisting(path, &place, Links::unchangeable); error != 0) return error;
     struct stat info {};
-    if (::lstat(path.c_str(), &info) != 0) return errno;
+    if (::fstatat(place.directory.get(), place.name.c_str(), &info, AT_SYMLINK_NOFOLLOW) != 0) return errno;
     if (S_ISREG(info.st_mode) || S_ISDIR(info.st_mode)) {
-      const UniqueFd item(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+      const UniqueFd item(::openat(place.directory.get(), place.name.c_str(),
+                                   O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
       if (!item.isValid()) return errno;
       const int error = S_ISDIR(info.st_mode) ? syncFileSystem(item.get()) : syncFile(item.get());
       if (error != 0) return error;
     }
-    Place place;
-    const int error = Place::open(path, &place);
-    if (error == EEXIST) return 0;  // a directory by itself, which the file system's sync has covered
-    return error != 0 ? error : syncNames(place.directory.get());
+    return syncNames(place.directory.get());
   });
 }
 
@@ -371,8 +488,8 @@ FileOutcome LinuxFileManager::createDirectory(const std::string& path, const Dir
 FileOutcome LinuxFileManager::listDirectory(const std::string& path,
                                             std::vector<std::string>* names) noexcept {
   return guarded([&] {
-    const UniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!directory.isValid()) return errno;
+    UniqueFd directory;
+    if (const int error = openToRead(path, O_RDONLY | O_DIRECTORY, &directory); error != 0) return error;
     DirectoryNames entries;
     if (const int error = entries.load(directory.get()); error != 0) return error;
     DirectoryNames::Entry entry{};
@@ -382,81 +499,49 @@ FileOutcome LinuxFileManager::listDirectory(const std::string& path,
 }
 
 FileOutcome LinuxFileManager::enumerateBelow(const std::string& path, ItemVisitor& visitor) noexcept {
-  struct Level {
-    HeldDirectory directory;
-    DirectoryNames names;
-    std::size_t pathLength;  // of the subpath down to this directory, its slash included
-  };
   return guarded([&] {
-    int first = 0;
-    std::vector<Level> levels;
-    std::string subpath;
-    const auto enter = [&](UniqueFd fd) {
-      Level level{HeldDirectory(std::move(fd)), {}, subpath.size()};
-      if (const int error = level.names.load(level.directory.get()); error != 0) return error;
-      if (levels.size() >= kHeldLevels) {
-        if (const int error = levels[levels.size() - kHeldLevels].directory.giveUp(); error != 0)
-          return error;
-      }
-      levels.push_back(std::move(level));
-      return 0;
-    };
-    UniqueFd top(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!top.isValid()) return errno;
-    if (const int error = enter(std::move(top)); error != 0) return error;
-    while (!levels.empty()) {
-      Level& level = levels.back();
-      subpath.resize(level.pathLength);
-      DirectoryNames::Entry entry{};
-      if (level.names.next(&entry)) {
-        const bool isDirectory = entry.type == DT_DIR;
-        subpath += entry.name;
-        if (visitor.visit(subpath, isDirectory) == ItemVisitor::Next::skipBelow || !isDirectory) continue;
-        UniqueFd below(
-            ::openat(level.directory.get(), entry.name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-        subpath += '/';
-        // ENOENT: the visitor took it away, or somebody else did.
-        const int error = below.isValid() ? enter(std::move(below)) : errno;
-        if (error != 0 && error != ENOENT && first == 0) first = error;
-        continue;
-      }
-      const Level done = std::move(levels.back());
-      levels.pop_back();
-      if (levels.empty()) break;
-      if (const int error = levels.back().directory.takeAgain(done.directory.get()); error != 0) {
-        return first != 0 ? first : error;
-      }
-    }
-    return first;
+    UniqueFd top;
+    if (const int error = openDirectory(path, &top, Links::own); error != 0) return error;
+    UniqueFd names = openForNames(top.get());
+    return names.isValid() ? EnumeratingWalk(visitor).run(std::move(names)) : errno;
   });
 }
 
-FileOutcome LinuxFileManager::setAttributes(const std::string& path,
-                                            const ItemAttributes& attributes) noexcept {
-  return guarded([&] {
-    // Of the item itself, and both of the same one: whoever owns the directory may put another in its place.
-    UniqueFd item;
-    if (const int error = openItem(path, &item); error != 0) return error;
-    if (attributes.uid || attributes.gid) {
-      const uid_t uid = attributes.uid.value_or(static_cast<uid_t>(-1));
-      const gid_t gid = attributes.gid.value_or(static_cast<gid_t>(-1));
-      if (::fchownat(item.get(), "", uid, gid, AT_EMPTY_PATH) != 0) return errno;
-    }
-    struct stat info {};
-    if (!attributes.mode) return 0;
-    if (::fstat(item.get(), &info) != 0) return errno;
-    if (S_ISLNK(info.st_mode)) return 0;
-    char self[32];
-    (void)std::snprintf(self, sizeof self, "/proc/self/fd/%d", item.get());
-    return ::chmod(self, *attributes.mode & 07777) == 0 ? 0 : errno;
-  });
+// Of the item at the path, and of everything below it first if that is asked for. 0 or errno.
+int LinuxFileManager::change(const std::string& path, const ItemAttributes& attributes, ItemKinds kinds,
+                             Reach reach) {
+  Place place;
+  if (const int error = Place::openExisting(path, &place, Links::unchangeable); error != 0) return error;
+  struct stat folder {};
+  struct stat info {};
+  UniqueFd item;
+  if (::fstat(place.directory.get(), &folder) != 0) return errno;
+  const int refused =
+      openToChange(place.directory.get(), place.name.c_str(), folder, attributes, &item, &info);
+  if (refused != 0) return refused;
+  if (kinds == ItemKinds::noFiles && S_ISREG(info.st_mode)) return EINVAL;
+  const bool hasBelow = reach == Reach::tree && S_ISDIR(info.st_mode);
+  const int below = hasBelow ? ChangingWalk(attributes).run(item.get(), info) : 0;
+  const int top = apply(attributes, item.get(), info);
+  return top != 0 ? top : below;
+}
+
+FileOutcome LinuxFileManager::setAttributes(const std::string& path, const ItemAttributes& attributes,
+                                            ItemKinds kinds) noexcept {
+  return guarded([&] { return change(path, attributes, kinds, Reach::item); });
+}
+
+FileOutcome LinuxFileManager::setAttributesOfTree(const std::string& path,
+                                                  const ItemAttributes& attributes) noexcept {
+  return guarded([&] { return change(path, attributes, ItemKinds::all, Reach::tree); });
 }
 
 std::optional<std::string> LinuxFileManager::readFile(const std::string& path, std::size_t limit) noexcept {
   try {
-    const UniqueFd file(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    UniqueFd file;
     struct stat info {};
-    if (!file.isValid() || ::fstat(file.get(), &info) != 0 || !S_ISREG(info.st_mode)) return std::nullopt;
+    if (openToRead(path, O_RDONLY | O_NONBLOCK | O_NOCTTY, &file) != 0) return std::nullopt;
+    if (::fstat(file.get(), &info) != 0 || !S_ISREG(info.st_mode)) return std::nullopt;
     if (static_cast<std::size_t>(info.st_size) > limit) return std::nullopt;
     std::string bytes;
     // One byte more than it should have: the read that gets nothing ends it. Some files say they are empty.
@@ -508,8 +593,11 @@ bool LinuxFileManager::writeFileAtomically(const std::string& path, std::string_
 
 bool LinuxFileManager::writeFile(const std::string& path, std::string_view bytes) noexcept {
   return guarded([&] {
-           const UniqueFd file(::open(
-               path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0644));
+           Place place;
+           if (const int error = openPlace(path, &place); error != 0) return error;
+           const UniqueFd file(::openat(place.directory.get(), place.name.c_str(),
+                                        O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC,
+                                        0644));
            if (!file.isValid()) return errno;
            return writeAll(file.get(), bytes);
          })

@@ -25,7 +25,7 @@ class LinuxFileManager final : public FileManager {
 
   bool itemExists(const std::string& path, bool* isDirectory) noexcept override;
   FileOutcome copyItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
-                       Durability durability = Durability::eventual) noexcept override;
+                       Durability durability = Durability::eventual, Gift* gift = nullptr) noexcept override;
   FileOutcome moveItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
                        Durability durability = Durability::eventual) noexcept override;
   FileOutcome removeItem(const std::string& path) noexcept override;
@@ -36,7 +36,10 @@ class LinuxFileManager final : public FileManager {
                               Intermediates intermediates) noexcept override;
   FileOutcome listDirectory(const std::string& path, std::vector<std::string>* names) noexcept override;
   FileOutcome enumerateBelow(const std::string& path, ItemVisitor& visitor) noexcept override;
-  FileOutcome setAttributes(const std::string& path, const ItemAttributes& attributes) noexcept override;
+  FileOutcome setAttributes(const std::string& path, const ItemAttributes& attributes,
+                            ItemKinds kinds = ItemKinds::all) noexcept override;
+  FileOutcome setAttributesOfTree(const std::string& path,
+                                  const ItemAttributes& attributes) noexcept override;
   std::optional<std::string> readFile(const std::string& path, std::size_t limit) noexcept override;
   bool writeFileAtomically(const std::string& path, std::string_view bytes) noexcept override;
   bool writeFile(const std::string& path, std::string_view bytes) noexcept override;
@@ -45,12 +48,14 @@ class LinuxFileManager final : public FileManager {
   struct ResolvedAttributes;
 
   int copy(const std::string& source, const std::string& destination, IfPresent ifPresent,
-           Durability durability);
+           Durability durability, Gift* gift);
   int move(const std::string& source, const std::string& destination, IfPresent ifPresent,
            Durability durability);
   int moveAcross(const Place& from, const Place& to, IfPresent ifPresent);
-  int stageCopy(int sourceDirectory, const char* source, struct stat* info, const Place& place, Stage& stage,
-                TreeCopier::Source afterwards, Durability durability);
+  int stageCopy(const Place& from, struct stat* info, const Place& to, Stage& stage,
+                TreeCopier::Source afterwards, Durability durability, Gift* gift = nullptr);
+  enum class Reach { item, tree };
+  int change(const std::string& path, const ItemAttributes& attributes, ItemKinds kinds, Reach reach);
   int makeDirectory(const std::string& path, const ResolvedAttributes& attributes);
   int makeDirectories(const std::string& path, const ResolvedAttributes& attributes);
   int openPlace(const std::string& path, Place* place);

@@ -198,7 +198,7 @@ TEST_F(LinuxFileManagerTest, HardLinksInsideATreeStayHardLinks) {
   EXPECT_EQ(contentOf(dir / "copy/sub/b"), "shared");
 }
 
-TEST_F(LinuxFileManagerTest, ADirectoryOfManyFilesIsCopiedWholeByTwoThreads) {
+TEST_F(LinuxFileManagerTest, ADirectoryOfManyFilesIsCopiedWhole) {
   std::set<std::string> expected;
   for (int i = 0; i < 500; ++i) {
     const std::string name = "f" + std::to_string(i);
@@ -214,8 +214,8 @@ TEST_F(LinuxFileManagerTest, ADirectoryOfManyFilesIsCopiedWholeByTwoThreads) {
   EXPECT_EQ(names("copy").size(), 501u);
 }
 
-// Directories enough for two threads, one in the other and side by side.
-class LinuxFileManagerTwoThreadsTest : public LinuxFileManagerTest {
+// Many directories, one in the other and side by side.
+class LargeTreeTest : public LinuxFileManagerTest {
  protected:
   static constexpr int kDirectories = 24;
   static constexpr int kFilesEach = 40;
@@ -223,7 +223,7 @@ class LinuxFileManagerTwoThreadsTest : public LinuxFileManagerTest {
   static std::string directoryName(int i) {
     return "tree/" + std::string(i % 3 == 0 ? "" : "deep/er/") + std::to_string(i);
   }
-  LinuxFileManagerTwoThreadsTest() {
+  LargeTreeTest() {
     for (int i = 0; i < kDirectories; ++i) {
       for (int k = 0; k < kFilesEach; ++k) {
         const std::string name = directoryName(i) + "/" + std::to_string(k);
@@ -231,7 +231,7 @@ class LinuxFileManagerTwoThreadsTest : public LinuxFileManagerTest {
       }
       dir.link(directoryName(i) + "/link", std::to_string(i));
     }
-    // Names of one file in two directories, so that each thread may meet one first.
+    // Names of one file in two directories.
     for (int i = 0; i + 1 < kDirectories; i += 2) {
       const std::string first = dir / (directoryName(i) + "/7");
       EXPECT_EQ(::link(first.c_str(), (dir / (directoryName(i + 1) + "/again")).c_str()), 0);
@@ -243,12 +243,12 @@ class LinuxFileManagerTwoThreadsTest : public LinuxFileManagerTest {
     setTimes(dir / "tree", 3000, 5000);
   }
   // An ordinary user removes nothing from a directory closed to writing.
-  ~LinuxFileManagerTwoThreadsTest() override {
+  ~LargeTreeTest() override {
     for (int i = 0; i < kDirectories; ++i) (void)::chmod((dir / directoryName(i)).c_str(), 0755);
   }
 };
 
-TEST_F(LinuxFileManagerTwoThreadsTest, ATreeOfManyDirectoriesIsCopiedWithEverythingAndRemoved) {
+TEST_F(LargeTreeTest, ATreeOfManyDirectoriesIsCopiedWithEverythingAndRemoved) {
   EXPECT_EQ(copy("tree", "copy"), kSuccess);
   for (int i = 0; i < kDirectories; ++i) {
     const std::string from = directoryName(i);
@@ -275,7 +275,7 @@ TEST_F(LinuxFileManagerTwoThreadsTest, ATreeOfManyDirectoriesIsCopiedWithEveryth
   EXPECT_EQ(names(""), (std::vector<std::string>{"tree"}));
 }
 
-TEST_F(LinuxFileManagerTwoThreadsTest, OnAFullDiskNothingOfTheTreeStaysAndTheSourceIsWhole) {
+TEST_F(LargeTreeTest, OnAFullDiskNothingOfTheTreeStaysAndTheSourceIsWhole) {
   dir.directory("disk");
   inPrivateMounts([&] {
     for (const int kibibytes : {200, 1000, 2500, 3500}) {  // it takes 4 KiB a file, and some
@@ -290,7 +290,7 @@ TEST_F(LinuxFileManagerTwoThreadsTest, OnAFullDiskNothingOfTheTreeStaysAndTheSou
   });
 }
 
-TEST_F(LinuxFileManagerTwoThreadsTest, AMoveToAnotherMountTakesEverything) {
+TEST_F(LargeTreeTest, AMoveToAnotherMountTakesEverything) {
   dir.directory("disk");
   inPrivateMounts([&] {
     mountSmallDisk(dir / "disk", 16 << 10);
@@ -305,7 +305,7 @@ TEST_F(LinuxFileManagerTwoThreadsTest, AMoveToAnotherMountTakesEverything) {
   EXPECT_FALSE(isThere(dir / "tree"));
 }
 
-TEST_F(LinuxFileManagerTwoThreadsTest, WhatCannotBeRemovedIsPassedOverAndItsDirectoriesStay) {
+TEST_F(LargeTreeTest, WhatCannotBeRemovedIsPassedOverAndItsDirectoriesStay) {
   if (::geteuid() != 0) GTEST_SKIP() << "mounts on what it removes";
   inPrivateMounts([&] {
     const std::string held = dir / (directoryName(5) + "/7");
@@ -530,6 +530,58 @@ TEST_F(WayTest, ALinkInAFolderThatAnotherAccountMayWriteIsNoWay) {
   if (::geteuid() != 0) return;
   ASSERT_EQ(::chown((dir / "folder").c_str(), 4711, 4711), 0);
   expectRefused();
+}
+
+TEST_F(WayTest, ToASourceOnlyOwnLinksLead) {
+  struct Nobody final : ItemVisitor {
+    Next visit(const std::string&, bool) noexcept override { return Next::descend; }
+  } nobody;
+  std::vector<std::string> listed;
+  // Everything that reads by way of folder/link, or lists it.
+  const auto outcomes = [&] {
+    std::filesystem::remove_all(dir / "copied");
+    bool isDirectory = false;
+    const bool exists = files.itemExists(dir / "folder/link/file", &isDirectory);
+    const bool isRead = files.readFile(dir / "folder/link/file", 100) == "kept";
+    return std::vector{copy("folder/link/file", "copied"), exists ? kSuccess : failure(ENOENT),
+                       isRead ? kSuccess : failure(ENOENT),
+                       files.listDirectory(dir / "folder/link/sub", &listed),
+                       files.enumerateBelow(dir / "folder/link", nobody)};
+  };
+  const auto expectAll = [&](const FileOutcome& wanted, const std::string& what) {
+    for (const FileOutcome& outcome : outcomes()) EXPECT_EQ(outcome, wanted) << what;
+  };
+  dir.directory("outside/sub");
+  dir.link("folder/link", dir / "outside");
+  expectAll(kSuccess, "own link in an own folder");
+  for (const mode_t mode : {0775u, 01777u}) {
+    ASSERT_EQ(::chmod((dir / "folder").c_str(), mode), 0);
+    expectAll(kSuccess, "own link that others may move, but that says the same everywhere");
+  }
+  std::filesystem::remove(dir / "folder/link");
+  dir.link("folder/link", "../outside");
+  expectAll(failure(ENOENT), "own link that others may move to where it leads elsewhere");
+  ASSERT_EQ(::chmod((dir / "folder").c_str(), 0755), 0);
+  expectAll(kSuccess, "own link that leads up, in an own folder");
+  if (::geteuid() != 0) return;
+  std::filesystem::remove(dir / "folder/link");
+  ASSERT_EQ(::lchown(dir.link("folder/link", dir / "outside").c_str(), 4711, 4711), 0);
+  expectAll(failure(ENOENT), "a link of somebody else");
+}
+
+TEST_F(WayTest, ASourceThatIsItselfALinkIsCopiedAsALinkAndReadThrough) {
+  dir.directory("outside/sub");
+  const std::string link = dir.link("folder/link", "../outside/sub");
+  const std::string fileLink = dir.link("folder/file", "../outside/file");
+  if (::geteuid() == 0) {
+    ASSERT_EQ(::lchown(link.c_str(), 4711, 4711), 0);
+    ASSERT_EQ(::lchown(fileLink.c_str(), 4711, 4711), 0);
+  }
+  EXPECT_EQ(copy("folder/link", "copied"), kSuccess);
+  EXPECT_EQ(std::filesystem::read_symlink(dir / "copied"), "../outside/sub");
+  EXPECT_EQ(files.readFile(fileLink, 100), "kept");
+  EXPECT_TRUE(files.itemExists(fileLink, nullptr));
+  EXPECT_TRUE(names("folder/link").empty());
 }
 
 // ---- leftovers
@@ -992,6 +1044,85 @@ TEST_F(LinuxFileManagerTest, AttributesGoToALinkItselfOrNotAtAll) {
   EXPECT_EQ(files.setAttributes(dir / "missing", {{}, 0, 0}), failure(ENOENT));
   EXPECT_EQ(files.setAttributes(file, {0644, {}, {}}), kSuccess);
   EXPECT_EQ(statOf(file).st_mode & 07777, 0644u);
+}
+
+TEST_F(LinuxFileManagerTest, WhatACopyIsGivenItHasWhenItShows) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give items away";
+  dir.file("file", "x");
+  dir.file("tree/below", "x");
+  dir.link("link", dir / "file");
+  ASSERT_EQ(::mkfifo((dir / "fifo").c_str(), 0600), 0);
+  for (const char* name : {"file", "tree", "link", "fifo"}) {
+    Gift gift{{0640, 4711, 4712}};
+    const std::string copied = dir / (std::string("copied-") + name);
+    EXPECT_EQ(files.copyItem(dir / name, copied, IfPresent::fail, Durability::onReturn, &gift), kSuccess);
+    EXPECT_EQ(gift.outcome, kSuccess) << name;
+    EXPECT_EQ(statOf(copied).st_uid, 4711u) << name;
+    EXPECT_EQ(statOf(copied).st_gid, 4712u) << name;
+    if (std::string_view(name) != "link") {
+      EXPECT_EQ(statOf(copied).st_mode & 07777, 0640u) << name;
+    }
+    EXPECT_EQ(statOf(dir / name).st_uid, 0u) << name;
+    EXPECT_EQ(files.copyItem(dir / name, copied, IfPresent::fail, Durability::eventual, &gift),
+              failure(EEXIST));
+    EXPECT_EQ(gift.outcome, failure(EEXIST)) << name;
+  }
+  EXPECT_EQ(statOf(dir / "copied-tree/below").st_uid, 0u);
+}
+
+TEST_F(LinuxFileManagerTest, OfAKindThatIsNotWantedNothingIsChanged) {
+  const std::string file = dir.file("file");
+  ASSERT_EQ(::chmod(file.c_str(), 0600), 0);
+  EXPECT_EQ(files.setAttributes(file, {0644, {}, {}}, ItemKinds::noFiles), failure(EINVAL));
+  EXPECT_EQ(statOf(file).st_mode & 07777, 0600u);
+  EXPECT_EQ(files.setAttributes(dir.directory("directory"), {0711, {}, {}}, ItemKinds::noFiles), kSuccess);
+  EXPECT_EQ(statOf(dir / "directory").st_mode & 07777, 0711u);
+}
+
+TEST_F(LinuxFileManagerTest, AFileWithFurtherNamesIsChangedOnlyWhereItsOwnerAloneCanHavePutThem) {
+  const std::string elsewhere = dir.file("elsewhere", "x");
+  dir.directory("tree/sub");
+  ASSERT_EQ(::chmod(elsewhere.c_str(), 0600), 0);
+  ASSERT_EQ(::link(elsewhere.c_str(), (dir / "tree/sub/name").c_str()), 0);
+  const auto change = [&](mode_t mode) {
+    return std::pair(files.setAttributesOfTree(dir / "tree", {mode, {}, {}}),
+                     files.setAttributes(dir / "tree/sub/name", {mode, {}, {}}));
+  };
+  EXPECT_EQ(change(0700), std::pair(kSuccess, kSuccess));  // the owner's own folder
+  EXPECT_EQ(statOf(elsewhere).st_mode & 07777, 0700u);
+  ASSERT_EQ(::chmod((dir / "tree/sub").c_str(), 0777), 0);
+  EXPECT_EQ(change(0755).first, failure(EPERM));  // anybody's
+  EXPECT_EQ(statOf(elsewhere).st_mode & 07777, 0700u);
+  EXPECT_EQ(statOf(dir / "tree/sub").st_mode & 07777, 0755u);
+  if (::geteuid() != 0) return;
+  ASSERT_EQ(::chown((dir / "tree/sub").c_str(), 4711, 4711), 0);
+  EXPECT_EQ(change(0750), std::pair(failure(EPERM), failure(EPERM)));  // somebody else's
+  EXPECT_EQ(statOf(elsewhere).st_mode & 07777, 0700u);
+  // A tree of one owner goes with both names of its files.
+  ASSERT_EQ(::chown(elsewhere.c_str(), 4711, 4711), 0);
+  dir.file("tree/sub/one", "x");
+  ASSERT_EQ(::chown((dir / "tree/sub/one").c_str(), 4711, 4711), 0);
+  ASSERT_EQ(::link((dir / "tree/sub/one").c_str(), (dir / "tree/sub/two").c_str()), 0);
+  EXPECT_EQ(files.setAttributesOfTree(dir / "tree", {{}, 0, 0}), kSuccess);
+  EXPECT_EQ(statOf(dir / "tree/sub/one").st_uid, 0u);
+}
+
+TEST_F(LinuxFileManagerTest, OfATreeTheTopsFailureCountsBeforeTheLastOneBelowAndTheRestIsChanged) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to make a file immutable";
+  dir.file("tree/a/stays");
+  dir.file("tree/b/changes");
+  const auto mark = [&](const char* name, int flag) {
+    const UniqueFd item(::open((dir / name).c_str(), O_RDONLY | O_CLOEXEC));
+    return ::ioctl(item.get(), FS_IOC_SETFLAGS, &flag) == 0;
+  };
+  if (!mark("tree/a/stays", FS_IMMUTABLE_FL)) GTEST_SKIP() << "nothing can be made immutable here";
+  EXPECT_EQ(files.setAttributesOfTree(dir / "tree", {{}, 4711, 4711}), failure(EPERM));
+  EXPECT_TRUE(mark("tree/a/stays", 0));
+  EXPECT_EQ(statOf(dir / "tree/a/stays").st_uid, 0u);
+  for (const char* name : {"tree", "tree/a", "tree/b", "tree/b/changes"}) {
+    EXPECT_EQ(statOf(dir / name).st_uid, 4711u) << name;
+  }
+  EXPECT_EQ(files.setAttributesOfTree(dir / "missing", {{}, 0, 0}), failure(ENOENT));
 }
 
 TEST_F(LinuxFileManagerTest, NamedOwnersAreLookedUp) {

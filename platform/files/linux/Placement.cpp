@@ -5,11 +5,9 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <limits.h>
-#include <linux/openat2.h>
 #include <sys/file.h>
 #include <sys/random.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -46,7 +44,6 @@ constexpr int kAttempts = 8;
 // Of what is looked at in one folder: whoever may write there can fill it. The rest waits for another time.
 constexpr std::size_t kMostEntries = 20'000;
 constexpr int kMostHidden = 1'000;
-constexpr int kMostLinks = 40;  // as the kernel follows on one way
 
 using HiddenName = char[48];
 
@@ -87,25 +84,6 @@ bool isEntry(int directory, const char* name, int item) {
 }
 
 bool isOwn(const struct stat& info) { return info.st_uid == ::geteuid(); }
-
-// A descriptor of O_PATH, or -1.
-int openWithoutLinks(const char* path, int flags) {
-  open_how how{};
-  how.flags = static_cast<unsigned>(O_PATH | O_CLOEXEC | flags);
-  how.resolve = RESOLVE_NO_SYMLINKS;
-  return static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, path, &how, sizeof how));
-}
-
-// ELOOP: there is a link on the way. ENOSYS: a service manager's filter, which cannot look into the
-// arguments.
-bool mayHaveLinks(int error) { return error == ELOOP || error == ENOSYS; }
-
-// Whether nobody but root and this account can have made the link, or can replace it.
-bool isTrusted(int directory, const struct stat& link) {
-  struct stat info {};
-  if (::fstat(directory, &info) != 0 || (info.st_mode & 0022) != 0) return false;
-  return (link.st_uid == 0 || isOwn(link)) && (info.st_uid == 0 || isOwn(info));
-}
 
 bool lock(int item) { return ::flock(item, LOCK_EX | LOCK_NB) == 0; }
 
@@ -182,64 +160,6 @@ int renameOver(int directory, const char* from, const char* to) {
 }
 
 }  // namespace
-
-int openItem(const std::string& path, UniqueFd* item) {
-  // Nothing is allocated where no link is on the way: an item just made is given away although memory is
-  // lacking.
-  item->reset(openWithoutLinks(path.c_str(), O_NOFOLLOW));
-  if (item->isValid() || !mayHaveLinks(errno)) return item->isValid() ? 0 : errno;
-  Place place;
-  const int error = Place::open(path, &place);
-  if (error != 0) return error == EEXIST ? openDirectory(path, item) : error;
-  item->reset(::openat(place.directory.get(), place.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-  return item->isValid() ? 0 : errno;
-}
-
-int openDirectory(const std::string& path, UniqueFd* directory) {
-  if (path.empty()) return ENOENT;
-  directory->reset(openWithoutLinks(path.c_str(), O_DIRECTORY));
-  if (directory->isValid() || !mayHaveLinks(errno)) return directory->isValid() ? 0 : errno;
-
-  std::string rest = path;
-  int links = 0;
-  UniqueFd at(::open(rest.front() == '/' ? "/" : ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
-  while (at.isValid()) {
-    rest.erase(0, rest.find_first_not_of('/'));
-    if (rest.empty()) {
-      *directory = std::move(at);
-      return 0;
-    }
-    const std::string name = rest.substr(0, rest.find('/'));
-    rest.erase(0, name.size());
-    UniqueFd next(::openat(at.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-    struct stat info {};
-    if (!next.isValid() || ::fstat(next.get(), &info) != 0) return errno;
-    if (!S_ISLNK(info.st_mode)) {
-      if (!S_ISDIR(info.st_mode)) return ENOTDIR;
-      at = std::move(next);
-      continue;
-    }
-    if (++links > kMostLinks) return ELOOP;
-    if (!isTrusted(at.get(), info)) return ENOENT;
-    char target[PATH_MAX];
-    const ssize_t length = ::readlinkat(next.get(), "", target, sizeof target);
-    if (length <= 0) return length < 0 ? errno : ENOENT;
-    rest.insert(0, std::string(target, static_cast<std::size_t>(length)) + "/");
-    if (target[0] == '/') at.reset(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
-  }
-  return errno;
-}
-
-int Place::open(const std::string& path, Place* place) {
-  std::size_t end = path.size();
-  while (end > 0 && path[end - 1] == '/') --end;
-  if (end == 0) return path.empty() ? ENOENT : EEXIST;
-  const std::size_t slash = path.rfind('/', end - 1);
-  place->name = slash == std::string::npos ? path.substr(0, end) : path.substr(slash + 1, end - slash - 1);
-  if (place->name == "." || place->name == "..") return EEXIST;
-  const std::string parent = slash == std::string::npos ? "." : path.substr(0, slash + 1);
-  return openDirectory(parent, &place->directory);
-}
 
 void removeLeftovers(int directory) {
   const UniqueFd here(::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));

@@ -9,27 +9,9 @@
 
 #include "platform/base/UniqueFd.h"
 #include "platform/files/FileManager.h"
+#include "platform/files/linux/Way.h"
 
 namespace brenvik {
-
-// Opens a directory (O_PATH), name by name. A symbolic link on the way is followed only when it is root's or
-// this account's own, and nobody else may write the directory it stands in: others could have it lead
-// anywhere. 0 or errno; ENOENT for such a link, as if the directory were missing. May throw std::bad_alloc.
-int openDirectory(const std::string& path, UniqueFd* directory);
-
-// Opens whatever is at the path (O_PATH): a link itself, and by the same way. 0 or errno. May throw
-// std::bad_alloc.
-int openItem(const std::string& path, UniqueFd* item);
-
-// The directory an item is to stand in, opened, and the item's name there.
-struct Place {
-  UniqueFd directory;
-  std::string name;
-
-  // Opens the directory part of the path, as openDirectory() does. 0 or errno; EEXIST for a path that names a
-  // directory by itself ("/", "." or ".." at the end). May throw std::bad_alloc.
-  static int open(const std::string& path, Place* place);
-};
 
 // Removes what killed processes have left in the directory: what a Stage or placeLink() had made there, and
 // nothing else. How that is told: see hidden names in Placement.cpp. May throw std::bad_alloc.

@@ -3,7 +3,8 @@
 //
 // File systems that know less than the usual ones: no files without a name, no flags of rename, no link to an
 // open file. The calls are refused here, because no such file system is to be had everywhere. And disks that
-// do not keep what they were given, and processes that are killed between two calls.
+// do not keep what they were given, processes that are killed between two calls, and strangers who rename
+// between two calls.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -20,7 +21,15 @@
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/files/linux/LinuxFileManager.h"
 
+namespace {
+
+// Is told of each directory before it is opened by its name.
+std::function<void(const char*)> beforeOpening;  // NOLINT
+
+}  // namespace
+
 extern "C" int openat(int directory, const char* path, int flags, ...) {
+  if (beforeOpening && (flags & (O_DIRECTORY | O_PATH)) == O_DIRECTORY) beforeOpening(path);
   const bool isUnnamed = (flags & O_TMPFILE) == O_TMPFILE;
   if (isUnnamed && brenvik::FailingCall::failsNow("openat(O_TMPFILE)")) return -1;
   mode_t mode = 0;
@@ -277,6 +286,51 @@ TEST_F(PlainFileSystemTest, ALinkThatCannotReplaceADirectoryLeavesNoHiddenOne) {
   dir.file("full/file", "x");
   EXPECT_EQ(files.placeLink(dir / "full", "target"), FileOutcome::failure(ENOTEMPTY));
   EXPECT_EQ(names(), (Names{"full"}));
+}
+
+// ---- renames between two calls
+
+TEST_F(PlainFileSystemTest, ALinkThatTakesAFoldersPlaceLeadsNoWalkOutOfTheTree) {
+  struct Visitor final : ItemVisitor {
+    Next visit(const std::string& subpath, bool) noexcept override {
+      seen.push_back(subpath);
+      return Next::descend;
+    }
+    std::vector<std::string> seen;
+  } visitor;
+  dir.file("outside/theirs", "kept");
+  dir.file("tree/sub/own", "x");
+  ASSERT_EQ(::chmod((dir / "outside/theirs").c_str(), 0600), 0);
+  dir.link("link", dir / "outside");
+  // The very moment before the folder is entered, the link stands in its place.
+  const auto swapped = [&](const std::function<FileOutcome()>& work) {
+    bool isSwapped = false;
+    const auto exchange = [&] {
+      EXPECT_EQ(::syscall(SYS_renameat2, AT_FDCWD, (dir / "tree/sub").c_str(), AT_FDCWD,
+                          (dir / "link").c_str(), RENAME_EXCHANGE),
+                0);
+    };
+    beforeOpening = [&](const char* name) {
+      if (isSwapped || std::string_view(name) != "sub") return;
+      isSwapped = true;
+      exchange();
+    };
+    const FileOutcome outcome = work();
+    beforeOpening = nullptr;
+    EXPECT_TRUE(isSwapped);
+    EXPECT_EQ(contentOf(dir / "outside/theirs"), "kept");
+    EXPECT_EQ(statOf(dir / "outside/theirs").st_mode & 07777, 0600u);
+    exchange();
+    return outcome;
+  };
+  EXPECT_EQ(swapped([&] { return files.setAttributesOfTree(dir / "tree", {0700, {}, {}}); }), kSuccess);
+  EXPECT_EQ(swapped([&] { return files.enumerateBelow(dir / "tree", visitor); }),
+            FileOutcome::failure(ENOTDIR));
+  EXPECT_EQ(visitor.seen, Names{"sub"});
+  EXPECT_EQ(swapped([&] { return copy("tree", "copied"); }), FileOutcome::failure(ENOTDIR));
+  EXPECT_EQ(names(), (Names{"link", "outside", "tree"}));
+  EXPECT_EQ(swapped([&] { return files.removeItem(dir / "tree"); }), FileOutcome::failure(ENOTDIR));
+  EXPECT_EQ(contentOf(dir / "tree/sub/own"), "x");
 }
 
 }  // namespace

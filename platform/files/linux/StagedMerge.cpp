@@ -8,66 +8,77 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
+#include <utility>
 
-#include "platform/base/UniqueFd.h"
-#include "platform/files/linux/DirectoryNames.h"
+#include "platform/files/linux/TreeWalk.h"
 
 namespace brenvik {
 namespace {
 
-constexpr int kOpenDirectory = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-
-}  // namespace
-
-int checkMerge(int staged, int destination) {
-  DirectoryNames names;
-  const UniqueFd here(::openat(staged, ".", kOpenDirectory));
-  if (!here.isValid()) return errno;
-  if (const int error = names.load(here.get()); error != 0) return error;
-  for (DirectoryNames::Entry entry{}; names.next(&entry);) {
-    struct stat there {};
-    if (::fstatat(destination, entry.name, &there, AT_SYMLINK_NOFOLLOW) != 0) {
-      if (errno != ENOENT) return errno;
-      continue;
-    }
-    const bool isDirectory = entry.type == DT_DIR;
-    if (isDirectory != S_ISDIR(there.st_mode)) return EEXIST;
-    if (!isDirectory) continue;
-    const UniqueFd from(::openat(here.get(), entry.name, kOpenDirectory));
-    const UniqueFd to(::openat(destination, entry.name, kOpenDirectory));
-    if (!from.isValid() || !to.isValid()) return errno;
-    if (const int error = checkMerge(from.get(), to.get()); error != 0) return error;
+// Walks what was staged, with the destination as its counterpart.
+class MergingWalk : public TreeWalk {
+ public:
+  int run(int staged, int destination) {
+    Level top;
+    top.directory = HeldDirectory(UniqueFd(::openat(staged, ".", kOpenDirectory)));
+    top.counterpart = HeldDirectory(UniqueFd(::openat(destination, ".", kOpenDirectory)));
+    if (top.directory.get() < 0 || top.counterpart.get() < 0) return errno;
+    return walk(std::move(top));
   }
-  return 0;
-}
 
-int mergeStaged(int staged, int destination) {
-  DirectoryNames names;
-  const UniqueFd here(::openat(staged, ".", kOpenDirectory));
-  if (!here.isValid()) return errno;
-  if (const int error = names.load(here.get()); error != 0) return error;
-  for (DirectoryNames::Entry entry{}; names.next(&entry);) {
-    if (entry.type != DT_DIR) {
-      if (::renameat(here.get(), entry.name, destination, entry.name) != 0) return errno;
-      continue;
+ protected:
+  static constexpr int kOpenDirectory = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+
+  int opened(Level& above, Level& below) override {
+    below.counterpart = HeldDirectory(UniqueFd(::openat(above.counterpart.get(), name(), kOpenDirectory)));
+    return below.counterpart.get() >= 0 ? 0 : errno;
+  }
+};
+
+class CheckingWalk final : public MergingWalk {
+  int visit(Level& level, const DirectoryNames::Entry& entry, bool* descend) override {
+    struct stat there {};
+    if (::fstatat(level.counterpart.get(), entry.name, &there, AT_SYMLINK_NOFOLLOW) != 0) {
+      return errno == ENOENT ? 0 : errno;
     }
+    *descend = entry.type == DT_DIR;
+    return *descend == S_ISDIR(there.st_mode) ? 0 : EEXIST;
+  }
+};
+
+class PlacingWalk final : public MergingWalk {
+  int visit(Level& level, const DirectoryNames::Entry& entry, bool* descend) override {
+    const int from = level.directory.get();
+    const int to = level.counterpart.get();
+    if (entry.type != DT_DIR) return ::renameat(from, entry.name, to, entry.name) == 0 ? 0 : errno;
     // rename(2) takes a whole directory where there is none; an empty one would give way, and does not here.
-    if (::renameat2(here.get(), entry.name, destination, entry.name, RENAME_NOREPLACE) == 0) continue;
-    bool isMade = false;
+    if (::renameat2(from, entry.name, to, entry.name, RENAME_NOREPLACE) == 0) return 0;
+    isMade_ = false;
     if (errno == EINVAL || errno == ENOSYS) {
-      isMade = ::mkdirat(destination, entry.name, 0700) == 0;
-      if (!isMade && errno != EEXIST) return errno;
+      isMade_ = ::mkdirat(to, entry.name, 0700) == 0;
+      if (!isMade_ && errno != EEXIST) return errno;
     } else if (errno != EEXIST) {
       return errno;
     }
-    const UniqueFd from(::openat(here.get(), entry.name, kOpenDirectory));
-    const UniqueFd to(::openat(destination, entry.name, kOpenDirectory));
-    struct stat info {};
-    if (!from.isValid() || !to.isValid() || ::fstat(from.get(), &info) != 0) return errno;
-    if (isMade && ::fchmod(to.get(), info.st_mode & 0777) != 0) return errno;
-    if (const int error = mergeStaged(from.get(), to.get()); error != 0) return error;
+    *descend = true;
+    return 0;
   }
-  return 0;
-}
+  int opened(Level& above, Level& below) override {
+    if (const int error = MergingWalk::opened(above, below); error != 0) return error;
+    if (!isMade_) return 0;
+    struct stat info {};
+    if (::fstat(below.directory.get(), &info) != 0) return errno;
+    return ::fchmod(below.counterpart.get(), info.st_mode & 0777) == 0 ? 0 : errno;
+  }
+
+  bool isMade_ = false;  // the destination's directory, on a file system without the flag
+};
+
+}  // namespace
+
+int checkMerge(int staged, int destination) { return CheckingWalk().run(staged, destination); }
+
+int mergeStaged(int staged, int destination) { return PlacingWalk().run(staged, destination); }
 
 }  // namespace brenvik

@@ -40,16 +40,12 @@ class TreeCopier {
                   const char* destinationName);
 
  private:
-  class Directory;
-  struct Level;
-  class Crew;
+  class CopyingWalk;
 
-  void learnUmask(int directory);
   int checkRemovable(int directory, const char* name) const;
-  int copyRegular(FileContents& contents, int from, int to, const char* name, bool* hasSeveralNames) const;
-  int copyAgain(int from, int to, const char* name, const std::string& pathHere);
-  // Everything in the level's directory but the directories, unless its files are handed over.
-  int copyEntries(Level& level, Crew& crew);
+  int copyRegular(int from, int to, const char* name, const std::string& path);
+  // Makes a second name of an item that has been copied already under another one. False: copy it.
+  bool linkAgain(const struct stat& info, int to, const char* name, const std::string& path);
 
   FileContents& contents_;
   const uid_t ownUid_;
@@ -59,5 +55,8 @@ class TreeCopier {
   mode_t umask_ = 0777;                                    // what creation takes from a mode
   std::map<std::pair<dev_t, ino_t>, std::string> linked_;  // files with several names: the first copy's path
 };
+
+// What creation in the directory takes from a mode.
+mode_t umaskIn(int directory) noexcept;
 
 }  // namespace brenvik

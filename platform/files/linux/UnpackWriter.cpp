@@ -16,6 +16,7 @@
 #include "platform/files/archive/ArchiveEntryPath.h"
 #include "platform/files/archive/ResourceCompanion.h"
 #include "platform/files/linux/FileContents.h"
+#include "platform/files/linux/TreeCopier.h"
 
 namespace brenvik {
 
@@ -73,12 +74,8 @@ UnpackWriter::UnpackWriter(int top, UnpackOptions options, std::uint64_t mostByt
     : top_(top),
       options_(options),
       mostBytes_(std::min(mostBytes, kMostBytes)),
-      onFileError_(std::move(onFileError)) {
-  // What creation takes from a mode: umask(2) can only be read by changing it, for all threads.
-  const UniqueFd probe(::openat(top, ".", O_TMPFILE | O_WRONLY | O_CLOEXEC, 0777));
-  struct stat info {};
-  if (probe.isValid() && ::fstat(probe.get(), &info) == 0) umask_ = 0777 & ~info.st_mode;
-}
+      onFileError_(std::move(onFileError)),
+      umask_(umaskIn(top)) {}
 
 int UnpackWriter::fileError(const std::string& path, int code) {
   const int answer = onFileError_ ? onFileError_({path, code}) : archive_answer::stopCopy;
@@ -186,6 +183,17 @@ int UnpackWriter::entryData(std::string_view bytes) {
   written_ += bytes.size();
   if (entry_.size != archive_frame::kUnknownSize && written_ > entry_.size) return EPROTO;
   return skipping_ ? 0 : writeAll(file_.get(), bytes);
+}
+
+UnpackWriter::Room UnpackWriter::roomForData() const {
+  if (skipping_ || !file_.isValid() || entry_.size == archive_frame::kUnknownSize) return {};
+  const std::uint64_t most = std::min(entry_.size - written_, mostBytes_ - std::min(bytes_, mostBytes_));
+  return {file_.get(), static_cast<std::size_t>(most)};
+}
+
+void UnpackWriter::dataWritten(std::size_t bytes) {
+  bytes_ += bytes;
+  written_ += bytes;
 }
 
 int UnpackWriter::entryCompanion(std::string_view bytes) {

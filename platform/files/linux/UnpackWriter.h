@@ -37,6 +37,14 @@ class UnpackWriter final : public ArchiveFrameSink {
   int entryCompanion(std::string_view bytes) override;
   int endEntry() override;
   int refuseEntry(const std::string& path, int code) override;
+  // Where the current entry's next data may be written to without entryData(), and at most how much of it.
+  struct Room {
+    int file = -1;
+    std::size_t bytes = 0;
+  };
+  Room roomForData() const;
+  // So much has been written there.
+  void dataWritten(std::size_t bytes);
   // After the last entry. 0 or errno.
   int finish();
 
@@ -56,7 +64,7 @@ class UnpackWriter final : public ArchiveFrameSink {
   const UnpackOptions options_;
   const std::uint64_t mostBytes_;
   const std::function<int(const ArchiveFileError&)> onFileError_;
-  mode_t umask_ = 0777;
+  const mode_t umask_;
 
   std::uint64_t entries_ = 0;
   std::uint64_t bytes_ = 0;

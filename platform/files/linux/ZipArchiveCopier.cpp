@@ -79,6 +79,28 @@ int makeBelow(int directory, const std::vector<std::string>& names, UniqueFd* la
   return last->isValid() ? 0 : errno;
 }
 
+// The reader's frames on their way to the writer.
+class Unpacking final : public ReaderOutput {
+ public:
+  Unpacking(ArchiveFrameParser& parser, UnpackWriter& writer) : parser_(parser), writer_(writer) {}
+  int take(std::string_view bytes) override { return parser_.take(bytes); }
+  std::size_t bestPiece() const override { return parser_.bestPiece(); }
+  bool isComplete() const override { return parser_.hasFinished(); }
+  // No more than the entry said and the cap allows: what is beyond goes through take(), which refuses it.
+  Direct direct() const override {
+    const UnpackWriter::Room room = writer_.roomForData();
+    return {room.file, std::min(room.bytes, parser_.dataAhead())};
+  }
+  void wentDirectly(std::size_t bytes) override {
+    parser_.pass(bytes);
+    writer_.dataWritten(bytes);
+  }
+
+ private:
+  ArchiveFrameParser& parser_;
+  UnpackWriter& writer_;
+};
+
 }  // namespace
 
 ArchiveCopierFactory ZipArchiveCopier::factory() {
@@ -95,9 +117,11 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
   if (!isOn(options, "extractPKZip")) return ENOTSUP;
   const auto deadline = std::chrono::steady_clock::now() + longest_;
   // O_NONBLOCK: a FIFO would hold the main loop until somebody writes.
-  const UniqueFd input(::open(archive.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  UniqueFd input;
   struct stat info {};
-  if (!input.isValid() || ::fstat(input.get(), &info) != 0) return errno;
+  if (const int error = openToRead(archive, O_RDONLY | O_NONBLOCK | O_NOCTTY, &input); error != 0)
+    return error;
+  if (::fstat(input.get(), &info) != 0) return errno;
   if (!S_ISREG(info.st_mode)) return EINVAL;
 
   // Beside a destination that is still to be made, or inside one that is there: on its file system either
@@ -126,9 +150,8 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
   {
     ReaderProcess reader;
     if (const int error = reader.start(reader_, input.get()); error != 0) return error;
-    const int error = reader.drain(
-        deadline, [&](std::string_view bytes) { return parser.take(bytes); },
-        [&] { return parser.bestPiece(); }, [&] { return parser.hasFinished(); });
+    Unpacking unpacking(parser, writer);
+    const int error = reader.drain(deadline, unpacking);
     *wasAnswered = writer.wasStoppedByAnswer();
     if (error != 0) return error;
   }

@@ -202,14 +202,49 @@ TEST_F(ZipArchiveCopierTest, BackslashesSeparateNamesAndWhatCameFromAPipeIsAFile
   EXPECT_EQ(statOf(dir / "out/piped").st_mode, S_IFREG | 0666u);
 }
 
-TEST_F(ZipArchiveCopierTest, LargeFilesComeOutByteForByte) {
-  std::string large(3'000'001, '\0');
+// As a service unit's filter does, for this process and the readers that it starts.
+void refuseInThisProcess(int call, unsigned error) {
+  sock_filter program[] = {
+      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
+      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, static_cast<unsigned>(call), 0, 1),
+      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | error),
+      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
+  };
+  const sock_fprog filter{std::size(program), program};
+  ASSERT_EQ(::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0), 0);
+  ASSERT_EQ(::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter), 0);
+}
+
+// Longer than all the pages that the reader lends the pipe, twice over.
+std::string largeContent() {
+  std::string large(5'000'001, '\0');
   for (std::size_t i = 0; i < large.size(); ++i) large[i] = static_cast<char>(i * 2654435761u >> 11);
+  return large;
+}
+
+TEST_F(ZipArchiveCopierTest, LargeFilesComeOutByteForByte) {
+  const std::string large = largeContent();
   ZipBuilder zip;
-  zip.file("small", "s").file("large", large).file("after", "a");
+  zip.file("small", "s").file("large", large).file("after", "a").file("again", large.substr(1, 200'000));
   EXPECT_EQ(unpack(zip.build()), 0);
   EXPECT_TRUE(contentOf(dir / "out/large") == large);
+  EXPECT_TRUE(contentOf(dir / "out/again") == large.substr(1, 200'000));
   EXPECT_EQ(contentOf(dir / "out/after"), "a");
+}
+
+TEST_F(ZipArchiveCopierTest, WherePagesCannotBeLentLargeFilesComeOutAllTheSame) {
+  const std::string large = largeContent();
+  const std::string archive = ZipBuilder().file("large", large).file("after", "a").build();
+  for (const int call : {SYS_splice, SYS_vmsplice}) {
+    inPrivateMounts([&] {
+      refuseInThisProcess(call, EPERM);
+      EXPECT_EQ(unpack(archive), 0) << call;
+      EXPECT_TRUE(contentOf(dir / "out/large") == large) << call;
+      EXPECT_EQ(contentOf(dir / "out/after"), "a") << call;
+      std::filesystem::remove_all(dir / "out");
+      std::filesystem::remove(dir / "archive.zip");
+    });
+  }
 }
 
 TEST_F(ZipArchiveCopierTest, AnEmptyArchiveMakesAnEmptyDestinationAndMissingFoldersAboveIt) {
@@ -376,27 +411,14 @@ TEST_F(ZipArchiveCopierTest, HostileArchivesAreRefusedWholeAndLeaveNothingAnywhe
   EXPECT_FALSE(isThere("/tmp/brenvik-absolute"));
 }
 
-// What RestrictSUIDSGID= of a service unit does to this call.
-void refuseOpenat2InThisProcess() {
-  sock_filter program[] = {
-      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_openat2, 0, 1),
-      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | ENOSYS),
-      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
-  };
-  const sock_fprog filter{std::size(program), program};
-  ASSERT_EQ(::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0), 0);
-  ASSERT_EQ(::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter), 0);
-  ASSERT_EQ(::syscall(SYS_openat2, -1, "", nullptr, 0), -1);
-  ASSERT_EQ(errno, ENOSYS);
-}
-
 TEST_F(ZipArchiveCopierTest, WhereOpenat2IsRefusedArchivesComeOutAllTheSame) {
   ZipBuilder zip;
   zip.file("top", "1").file("a/b/c", "2").directory("a/empty").link("a/link", "../top");
   const std::string good = zip.build();
   inPrivateMounts([&] {
-    refuseOpenat2InThisProcess();
+    refuseInThisProcess(SYS_openat2, ENOSYS);  // as RestrictSUIDSGID= does
+    ASSERT_EQ(::syscall(SYS_openat2, -1, "", nullptr, 0), -1);
+    ASSERT_EQ(errno, ENOSYS);
     EXPECT_EQ(unpack(good), 0);
     EXPECT_EQ(contentOf(dir / "out/top"), "1");
     EXPECT_EQ(contentOf(dir / "out/a/b/c"), "2");
@@ -552,6 +574,24 @@ TEST_F(ZipArchiveCopierTest, FramesThatNoCorrectReaderSendsAreAFatalErrorAndLeav
         frame(archive_frame::Type::failed, std::string("\5\0\0\0", 4))}) {
     EXPECT_NE(copyFrames(frames), 0);
     EXPECT_NE(fatal, std::nullopt);
+    EXPECT_FALSE(isThere(dir / "out"));
+  }
+}
+
+TEST_F(ZipArchiveCopierTest, AReaderThatSendsMoreOrLessThanItSaidGetsNoLargeFile) {
+  // Large enough that the bytes do not pass through this process.
+  const std::string megabyte(1 << 20, 'x');
+  const std::string data = frame(archive_frame::Type::data, megabyte);
+  ASSERT_EQ(copyFrames(entryFrame("file", 2 << 20) + data + data + kEndOfEntry + kEnd), 0);
+  EXPECT_EQ(std::filesystem::file_size(dir / "out/file"), std::uintmax_t{2} << 20);
+  std::filesystem::remove_all(dir / "out");
+  const std::string twice = entryFrame("file", 2 << 20) + data + data;
+  for (const std::string& frames :
+       {twice + data + kEndOfEntry + kEnd, twice + frame(archive_frame::Type::data, "x") + kEndOfEntry + kEnd,
+        entryFrame("file", (2 << 20) - 1) + data + data + kEndOfEntry + kEnd,
+        entryFrame("file", (2 << 20) + 1) + data + data + kEndOfEntry + kEnd, twice, twice + kEnd,
+        entryFrame("file", std::uint64_t{1} << 40) + data + kEndOfEntry + kEnd}) {
+    EXPECT_NE(copyFrames(frames), 0);
     EXPECT_FALSE(isThere(dir / "out"));
   }
 }

@@ -55,7 +55,7 @@ bool filterSystemCalls() {
       SCMP_SYS(fstat),        SCMP_SYS(brk),       SCMP_SYS(mmap),          SCMP_SYS(munmap),
       SCMP_SYS(mremap),       SCMP_SYS(close),     SCMP_SYS(futex),         SCMP_SYS(fcntl),
       SCMP_SYS(fadvise64),    SCMP_SYS(getrandom), SCMP_SYS(clock_gettime), SCMP_SYS(madvise),
-      SCMP_SYS(rt_sigreturn), SCMP_SYS(exit),      SCMP_SYS(exit_group)};
+      SCMP_SYS(rt_sigreturn), SCMP_SYS(exit),      SCMP_SYS(exit_group),    SCMP_SYS(vmsplice)};
   scmp_filter_ctx filter = ::seccomp_init(SCMP_ACT_KILL_PROCESS);
   if (filter == nullptr) return false;
   bool good = true;

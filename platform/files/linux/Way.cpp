@@ -1,0 +1,110 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/files/linux/Way.h"
+
+#include <fcntl.h>
+#include <limits.h>
+#include <linux/openat2.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <string_view>
+
+namespace brenvik {
+namespace {
+
+constexpr int kMostLinks = 40;  // as the kernel follows on one way
+
+bool isOwn(const struct stat& info) { return info.st_uid == 0 || info.st_uid == ::geteuid(); }
+
+bool openWithoutLinks(const std::string& path, int flags, UniqueFd* item) {
+  open_how how{};
+  how.flags = static_cast<unsigned>(flags | O_CLOEXEC);
+  how.resolve = RESOLVE_NO_SYMLINKS;
+  item->reset(static_cast<int>(::syscall(SYS_openat2, AT_FDCWD, path.c_str(), &how, sizeof how)));
+  return item->isValid();
+}
+
+// ELOOP: there is a link on the way. ENOSYS: a service manager's filter, which cannot look into the
+// arguments.
+bool mayHaveLinks(int error) { return error == ELOOP || error == ENOSYS; }
+
+bool leadsUp(std::string_view target) {
+  return ("/" + std::string(target) + "/").find("/../") != std::string::npos;
+}
+
+bool isFollowed(int directory, const struct stat& link, std::string_view target, Links links) {
+  struct stat info {};
+  if (!isOwn(link) || ::fstat(directory, &info) != 0) return false;
+  if (isOwn(info) && (info.st_mode & 0022) == 0) return true;
+  return links == Links::own && (target.front() == '/' || !leadsUp(target));
+}
+
+}  // namespace
+
+int openDirectory(const std::string& path, UniqueFd* directory, Links links) {
+  if (path.empty()) return ENOENT;
+  if (openWithoutLinks(path, O_PATH | O_DIRECTORY, directory)) return 0;
+  if (!mayHaveLinks(errno)) return errno;
+
+  std::string rest = path;
+  int followed = 0;
+  UniqueFd at(::open(rest.front() == '/' ? "/" : ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  while (at.isValid()) {
+    rest.erase(0, rest.find_first_not_of('/'));
+    if (rest.empty()) {
+      *directory = std::move(at);
+      return 0;
+    }
+    const std::string name = rest.substr(0, rest.find('/'));
+    rest.erase(0, name.size());
+    UniqueFd next(::openat(at.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    struct stat info {};
+    if (!next.isValid() || ::fstat(next.get(), &info) != 0) return errno;
+    if (!S_ISLNK(info.st_mode)) {
+      if (!S_ISDIR(info.st_mode)) return ENOTDIR;
+      at = std::move(next);
+      continue;
+    }
+    if (++followed > kMostLinks) return ELOOP;
+    char text[PATH_MAX];
+    const ssize_t length = ::readlinkat(next.get(), "", text, sizeof text);
+    if (length <= 0) return length < 0 ? errno : ENOENT;
+    const std::string_view target(text, static_cast<std::size_t>(length));
+    if (!isFollowed(at.get(), info, target, links)) return ENOENT;
+    rest.insert(0, std::string(target) + "/");
+    if (target.front() == '/') at.reset(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+  }
+  return errno;
+}
+
+int openToRead(const std::string& path, int flags, UniqueFd* item) {
+  if (openWithoutLinks(path, flags, item)) return 0;
+  if (!mayHaveLinks(errno)) return errno;
+  Place place;
+  if (const int error = Place::openExisting(path, &place, Links::own); error != 0) return error;
+  item->reset(::openat(place.directory.get(), place.name.c_str(), flags | O_CLOEXEC));
+  return item->isValid() ? 0 : errno;
+}
+
+int Place::open(const std::string& path, Place* place, Links links) {
+  std::size_t end = path.size();
+  while (end > 0 && path[end - 1] == '/') --end;
+  if (end == 0) return path.empty() ? ENOENT : EEXIST;
+  const std::size_t slash = path.rfind('/', end - 1);
+  place->name = slash == std::string::npos ? path.substr(0, end) : path.substr(slash + 1, end - slash - 1);
+  if (place->name == "." || place->name == "..") return EEXIST;
+  const std::string parent = slash == std::string::npos ? "." : path.substr(0, slash + 1);
+  return openDirectory(parent, &place->directory, links);
+}
+
+int Place::openExisting(const std::string& path, Place* place, Links links) {
+  const int error = path.ends_with('/') ? EEXIST : open(path, place, links);
+  if (error != EEXIST) return error;
+  place->name = ".";
+  return openDirectory(path, &place->directory, links);
+}
+
+}  // namespace brenvik
