@@ -7,10 +7,14 @@ BRENVIK_BUILD names the build folder, BRENVIK_SOURCE the project's.
 """
 import os
 import pathlib
+import plistlib
 import re
 import shlex
+import socket
+import struct
 import subprocess
 import tempfile
+import threading
 import unittest
 
 from fake_helper import FakeHelper
@@ -69,6 +73,43 @@ class InstalledClient(unittest.TestCase):
         run("c++", "-std=c++20", *STRICT, "-x", "c++", CONSUMER / "main.c", "-x", "none", "-o", program,
             *self.config("--cflags", "--libs"))
         self.expect_working(program)
+
+    def test_the_examples_in_cpp_compile_in_both_languages_and_do_what_they_say(self):
+        environment = {**os.environ, "LD_LIBRARY_PATH": str(self.library.parent)}
+        stored = []
+
+        def answer(request):
+            if request.id == 8683555:
+                stored.append(request.region())
+                return request.status(0)
+            return request.payload(stored[-1]) if request.id == 8683556 else request.string("DE", 64)
+
+        def push(request):
+            region = plistlib.dumps({"CountryCode": "NO", "City": "Oslo"}, fmt=plistlib.FMT_BINARY)
+            with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as sender:
+                sender.connect(str(self.folder / "com.norvale.brenvik"))
+                sender.send(struct.pack("<IIIIIi", 0x80000012, 52, 7, 0, 0, 9100001) + struct.pack(
+                    "<IQBBBBI", 1, 56, 0, 1, 0, 1, len(region)) + bytes([0, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0]) + region)
+                self.assertEqual(len(sender.recv(100)), 44)
+            return request.status(0)
+
+        def push_later(request):
+            threading.Thread(target=push, args=(request,)).start()
+            return request.status(0)
+
+        for standard in ("c++20", "c++23"):
+            for name, work, words, expected in (
+                    ("preferences", answer, [], "52 bytes of XML\ncountry \"DE\"\n"),
+                    ("pushes", push_later, [self.folder], 'country "NO", city "Oslo"\n')):
+                program = self.folder / f"{name}-{standard}"
+                run("c++", f"-std={standard}", *STRICT, "-Wconversion", "-Wold-style-cast",
+                    SOURCE / "client" / "examples" / "cpp" / f"{name}.cpp", "-o", program, *self.config("--cflags", "--libs"))
+                path = self.folder / "helper"
+                with FakeHelper(path, work):
+                    self.assertEqual(run(program, path, *words, env=environment), expected)
+                path.unlink()
+                failed = subprocess.run([program, path, *words], env=environment, capture_output=True, text=True, timeout=60)
+                self.assertEqual((failed.returncode, failed.stderr), (1, "cannot connect: no helper answers at its socket\n"))
 
     def test_through_cmake(self):
         build = self.folder / "consumer"

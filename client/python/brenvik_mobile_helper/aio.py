@@ -89,7 +89,7 @@ class AsyncClient(AsyncRoutines):
             return True
 
     def _drop(self, failure):
-        """Closes the channel; failure(is_last) makes the exception of each call under way."""
+        """Closes the channel; failure(number) makes the exception of each call under way, the first of which is 0."""
         if self._channel is not None:
             if self._loop is not None and not self._loop.is_closed():
                 self._loop.remove_reader(self._channel.fileno())
@@ -98,9 +98,9 @@ class AsyncClient(AsyncRoutines):
             self._death_watch.close()
             self._channel = self._death_watch = None
         pending, self._pending = list(self._pending.values()), {}
-        for number, (_, future) in enumerate(pending, 1):
+        for number, (_, future) in enumerate(pending):
             if not future.done():
-                future.set_exception(failure(number == len(pending)))
+                future.set_exception(failure(number))
         self._wake()
 
     def _wake(self):
@@ -117,8 +117,10 @@ class AsyncClient(AsyncRoutines):
         except (BlockingIOError, InterruptedError):
             return
         except OSError:
-            # The helper left datagrams unread, and the last of them certainly.
-            self._drop(lambda is_last: HelperGoneError() if is_last else AnswerLostError())
+            # The helper left datagrams unread. It reads a request when it has answered the one before, so all but the first
+            # of several were not carried out; of one alone the kernel says that it was left.
+            is_alone = len(self._pending) == 1
+            self._drop(lambda number: HelperGoneError() if number or is_alone else AnswerLostError())
             return
         try:
             if not data:
