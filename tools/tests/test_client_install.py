@@ -99,7 +99,7 @@ class InstalledClient(unittest.TestCase):
 
         for standard in ("c++20", "c++23"):
             for name, work, words, expected in (
-                    ("preferences", answer, [], "52 bytes of XML\ncountry \"DE\"\n"),
+                    ("preferences", answer, [], "51 bytes of XML\ncountry \"DE\"\n"),
                     ("pushes", push_later, [self.folder], 'country "NO", city "Oslo"\n')):
                 program = self.folder / f"{name}-{standard}"
                 run("c++", f"-std={standard}", *STRICT, "-Wconversion", "-Wold-style-cast",

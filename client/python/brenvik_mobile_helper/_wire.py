@@ -13,7 +13,7 @@ from ._table import (ALIGNMENT, CHECK_IN_DISPOSITION, CHECK_IN_REPLY_DISPOSITION
 
 HEADER = struct.Struct("<IIIIIi")
 REGION = struct.Struct("<QBBBBI")
-_PORT = struct.Struct("<IIHBB")
+PORT_DESCRIPTOR = struct.Struct("<IIHBB")
 _CODE = struct.Struct("<i")
 SIMPLE_BITS = REPLY_DISPOSITION
 COMPLEX_BITS = COMPLEX | REPLY_DISPOSITION
@@ -206,6 +206,55 @@ def _read_sealed(memory: int, length: int) -> bytes:
     return data
 
 
+# ---- requests, as they arrive ----
+
+class WrongDescriptor(ValueError):
+    """A descriptor of another kind, or whose size is not the one in the body."""
+
+
+def unpack(routine: Routine, data: bytes, descriptors: list[int]) -> dict:
+    """The arguments of a request by name, the opposite of pack(). ValueError when it is malformed."""
+    at, memories, regions = routine.request_size, list(descriptors), {}
+    if routine.descriptors and struct.unpack_from("<I", data.ljust(28, b"\0"), 24)[0] != routine.descriptors:
+        raise ValueError("another number of descriptors")
+    if len(data) < routine.request_size:
+        raise ValueError("the message is too short")
+    for each in routine.arguments:
+        if each.type != "region":
+            continue
+        address, _, _, _, kind, length = REGION.unpack_from(data, each.offset)
+        if kind != OUT_OF_LINE:
+            raise WrongDescriptor("a descriptor of another kind")
+        if length == 0:
+            regions[each.name] = b""
+        elif address == 0:
+            if not memories:
+                raise ValueError("fewer descriptors than the message says")
+            regions[each.name] = _read_sealed(memories.pop(0), length)
+        else:
+            start = -(-at // ALIGNMENT) * ALIGNMENT
+            if address != start or start + length > len(data):
+                raise ValueError("the region is not where it should be")
+            regions[each.name] = data[start:start + length]
+            at = start + length
+    if memories or len(data) != at:
+        raise ValueError("more came than the message says")
+    arguments: dict = {}
+    for each in routine.arguments:
+        field = data[each.offset:each.offset + each.size]
+        if each.type == "text":
+            arguments[each.name] = field.partition(b"\0")[0].decode("utf-8", "surrogateescape")
+        elif each.type == "i32":
+            arguments[each.name], = struct.unpack("<i", field)
+        elif each.type == "f64":
+            arguments[each.name], = struct.unpack("<d", field)
+        elif each.type == "region":
+            arguments[each.name] = regions[each.name]
+        elif each.type == "regionSize" and struct.unpack("<I", field)[0] != len(regions[each.region]):
+            raise WrongDescriptor("a region's two sizes differ")
+    return arguments
+
+
 # ---- replies ----
 
 def rights_in(ancillary) -> list[int]:
@@ -271,14 +320,14 @@ def _read_complex(form, data, descriptors):
             raise ProtocolError(detail=str(error)) from None
     if form != "check-in" or len(data) != REPLY_SIZES["check-in"] or data[24:28] != b"\1\0\0\0" or len(descriptors) != 1:
         raise ProtocolError(detail="the answer has another form")
-    _, _, _, disposition, kind = _PORT.unpack_from(data, DESCRIPTORS)
+    _, _, _, disposition, kind = PORT_DESCRIPTOR.unpack_from(data, DESCRIPTORS)
     if kind != PORT or disposition != CHECK_IN_REPLY_DISPOSITION or not is_channel(descriptors[0]):
         raise ProtocolError(detail="the channel's descriptor is not as it should be")
     return None
 
 
 def check_in_message(port: int) -> bytes:
-    return HEADER.pack(COMPLEX_BITS, CHECK_IN.request_size, port, 0, 0, CHECK_IN.id) + struct.pack("<I", 1) + _PORT.pack(
+    return HEADER.pack(COMPLEX_BITS, CHECK_IN.request_size, port, 0, 0, CHECK_IN.id) + struct.pack("<I", 1) + PORT_DESCRIPTOR.pack(
         0, 0, 0, CHECK_IN_DISPOSITION, PORT)
 
 
