@@ -286,7 +286,7 @@ class Client(Routines):
             if error.code != BAD_ID:
                 raise
 
-    def call(self, name: str, **arguments):
+    def call(self, name: str, /, **arguments):
         """Calls a routine by its name in the protocol's table, with arguments named as there.
 
         Regions are bytes, both ways, and are sent as they are: a value that is a property list already need not be made

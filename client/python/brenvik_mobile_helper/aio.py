@@ -214,7 +214,7 @@ class AsyncClient(AsyncRoutines):
             if error.code != BAD_ID:
                 raise
 
-    async def call(self, name: str, **arguments):
+    async def call(self, name: str, /, **arguments):
         """Calls a routine by its name in the protocol's table; see Client.call."""
         routine = ROUTINES.get(name)
         if routine is None:

@@ -205,8 +205,13 @@ def _main(arguments: list[str]) -> int:
         return DONE
     if not command and not options.directory:
         raise _Usage("without a command, --directory must say where the sockets go")
+    return _run(options, script, command)
+
+
+def _run(options, script: Script, command: list[str]) -> int:
     log = None if command else sys.stdout
-    with contextlib.ExitStack() as stack:
+    stack = contextlib.ExitStack()
+    try:
         if options.log:
             log = stack.enter_context(open(options.log, "w", encoding="utf-8", errors="backslashreplace"))
         elif log is not None and hasattr(log, "reconfigure"):
@@ -216,6 +221,8 @@ def _main(arguments: list[str]) -> int:
         status = asyncio.run(program.run())
         strict = program.strictly() if options.strict else DONE
         return status or strict
+    finally:
+        stack.close()
 
 
 def main() -> int:

@@ -118,10 +118,15 @@ class _Line:
     def is_over(self) -> bool:
         return self.at >= len(self.text)
 
+    @property
+    def rest(self) -> str:
+        """The next word, whatever it is made of."""
+        return self.text[self.at:].split(" ")[0]
+
     def word(self, what: str) -> str:
         found = _WORD.match(self.text, self.at)
         if not found:
-            raise self.error(f"{what} is missing" if self.is_over else f"expected {what}, not {self.text[self.at:].split()[0]!r}")
+            raise self.error(f"{what} is missing" if self.is_over else f"expected {what}, not {self.rest!r}")
         self.at = found.end()
         self._skip()
         return found[0]
@@ -158,13 +163,13 @@ class _Line:
         """NAME= or NAME~, and what stands between."""
         found = re.compile(r"([A-Za-z_]+)([=~])").match(self.text, self.at)
         if not found:
-            raise self.error(f"expected {what}, not {self.text[self.at:].split()[0]!r}")
+            raise self.error(f"expected {what}, not {self.rest!r}")
         self.at = found.end()
         return found[1], found[2]
 
     def end(self):
         if not self.is_over:
-            raise self.error(f"nothing was expected behind this: {self.text[self.at:].split()[0]!r}")
+            raise self.error(f"nothing was expected behind this: {self.rest!r}")
 
 
 def _choice(line: _Line, word: str, choices, what: str) -> str:
