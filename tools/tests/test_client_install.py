@@ -111,6 +111,23 @@ class InstalledClient(unittest.TestCase):
                 failed = subprocess.run([program, path, *words], env=environment, capture_output=True, text=True, timeout=60)
                 self.assertEqual((failed.returncode, failed.stderr), (1, "cannot connect: no helper answers at its socket\n"))
 
+    def test_every_program_of_the_page_about_cpp_prints_what_stands_below_it(self):
+        page = (SOURCE / "docs" / "cpp.md").read_text()
+        programs = re.findall(r"^```cpp\n(.*?)^```\n```text\n(.*?)^```$", page, re.M | re.S)
+        self.assertEqual(len(programs), 2)
+        script = self.folder / "script"
+        script.write_text('on SetVoicemailToken\non CopyCountryCode\n answer "NO"\non LoadPlistFile\n fail 9\n'
+                          'on RequestCountryCodeFromLocation\n push civic-info City="Oslo"\n')
+        for number, (code, expected) in enumerate(programs):
+            source, program = self.folder / f"page-{number}.cpp", self.folder / f"page-{number}"
+            source.write_text(code)
+            run("c++", "-std=c++20", *STRICT, source, "-o", program, *self.config("--cflags", "--libs"))
+            done = subprocess.run([BUILD / "brenvik-mobile-helper-mock", script, "--", program], capture_output=True, text=True,
+                                  timeout=60, env={**os.environ, "LD_LIBRARY_PATH": str(self.library.parent)})
+            if "namespaces" in done.stderr:
+                self.skipTest("this system lets no program make namespaces")
+            self.assertEqual((done.returncode, done.stdout, done.stderr), (0, expected, ""))
+
     def test_through_cmake(self):
         build = self.folder / "consumer"
         run("cmake", "-S", CONSUMER, "-B", build, f"-DCMAKE_PREFIX_PATH={self.prefix}")

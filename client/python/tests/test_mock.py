@@ -530,6 +530,8 @@ class Completions(unittest.TestCase):
             pattern = r" -l ([a-z]+)" if shell == "fish" else r"(--[a-z]+)\b"
             found = {each if each.startswith("--") else f"--{each}" for each in re.findall(pattern, text)}
             self.assertEqual(found, options, shell)
+        page = (support.SOURCE / "docs" / "man" / "brenvik-mobile-helper-mock.1.scd").read_text()
+        self.assertEqual(set(re.findall(r"^\*(--[a-z]+)\*", page, re.M)), options)
 
     def test_bash_and_fish_offer_them(self):
         folder = support.SOURCE / "client" / "python" / "completions"
