@@ -114,6 +114,7 @@ std::int32_t Client::codeOf(Exchange outcome) const noexcept {
 }
 
 void Client::interrupt() noexcept {
+  if (interrupted_) return;  // whoever set it does the rest
   const int error = errno;
   ++interrupters_;  // keeps both descriptors from being closed
   interrupted_ = true;
