@@ -25,9 +25,12 @@ struct BegunCall {
 
   const RoutineFacts* routine = nullptr;  // kCheckInRoutine: a check-in, which has no message
   State state = State::waiting;
+  bool isBlocking = false;   // a blocking call among begun ones: its number is nobody's
   bool wasReturned = false;  // a channel ended that it had been given to
   PortName replyPort = kNullPort;
   Deadline deadline = Deadline::never();
+  bvmh_call publicNumber() const noexcept { return isBlocking ? 0 : result.call; }
+
   std::vector<std::byte> message;
   std::array<std::vector<std::byte>, kMostRegions> regions;
   bvmh_result result{};

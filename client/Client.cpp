@@ -262,6 +262,7 @@ std::int32_t Client::callAmongBegun(const RoutineFacts& routine, std::span<const
                                     Regions regions, bvmh_result* result) noexcept {
   BegunCall* const call = add(routine, message, regions, nullptr);
   if (call == nullptr) return BVMH_ERROR_NO_MEMORY;
+  call->isBlocking = true;
   const bvmh_call number = call->result.call;
   for (;;) {
     settle();

@@ -181,7 +181,7 @@ void Client::sendWaiting() noexcept {
     switch (
         sendMessage(channel_.get(), request.parts(), request.descriptors(), Deadline::never(), &waiting)) {
       case Io::done:
-        questions_.asked(call.routine->id, call.result.call, now());
+        questions_.asked(call.routine->id, call.publicNumber(), now());
         calls_.markSent(place);
         break;
       case Io::timedOut:
@@ -290,7 +290,7 @@ void Client::expire() noexcept {
 void Client::finish(BegunCall& call, std::int32_t code, int systemError) noexcept {
   const bool mayBeCarriedOut =
       code == BVMH_OK || code == BVMH_ERROR_TIMED_OUT || code == BVMH_ERROR_ANSWER_LOST;
-  if (!mayBeCarriedOut) questions_.refused(call.routine->id, call.result.call);
+  if (!mayBeCarriedOut) questions_.refused(call.routine->id, call.publicNumber());
   calls_.finish(call, code, systemError);
 }
 

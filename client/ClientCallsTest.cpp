@@ -537,6 +537,37 @@ TEST_F(BegunCallsTest, DisconnectingEndsThemAll) {
   EXPECT_EQ(result.code, BVMH_ERROR_NOT_CONNECTED);
 }
 
+TEST_F(BegunCallsTest, APushIsMatchedToTheOneQuestionThatIsUnderWay) {
+  serveConnected([](Script& script) {
+    const UniqueFd channel = script.checkIn();
+    for (const std::int32_t code : {0, 0, 5, 0}) answer(script, channel, code);
+    script.expectEnd(channel);
+  });
+  bvmh_event civic{};
+  civic.kind = BVMH_EVENT_CIVIC_INFO;
+  bvmh_call matched = 99;
+  EXPECT_EQ(bvmh_match_push(client(), &civic, &matched), BVMH_ERROR_NOT_ASKED);
+  EXPECT_EQ(matched, 0U);
+  bvmh_call first = 0;
+  ASSERT_EQ(BVMobileHelperRequestCountryCodeFromLocationBegin(client(), 1, 2, nullptr, &first), BVMH_OK);
+  // A push may be there before the answer is read.
+  EXPECT_EQ(bvmh_match_push(client(), &civic, &matched), BVMH_OK);
+  EXPECT_EQ(matched, first);
+  // A blocking call has no number.
+  EXPECT_EQ(BVMobileHelperRequestCountryCodeFromLocation(client(), 1, 2), BVMH_OK);
+  EXPECT_EQ(bvmh_match_push(client(), &civic, &matched), BVMH_OK);
+  EXPECT_EQ(matched, 0U);
+  // One that the helper refused will not be answered.
+  EXPECT_EQ(codeOfNext(client(), first), BVMH_OK);
+  bvmh_call refused = 0;
+  ASSERT_EQ(BVMobileHelperRequestCountryCodeFromLocationBegin(client(), 1, 2, nullptr, &refused), BVMH_OK);
+  EXPECT_EQ(codeOfNext(client(), refused), 5);
+  EXPECT_EQ(bvmh_match_push(client(), &civic, nullptr), BVMH_ERROR_NOT_ASKED);
+  EXPECT_EQ(bvmh_match_push(nullptr, &civic, nullptr), BVMH_ERROR_INVALID_ARGUMENT);
+  EXPECT_EQ(bvmh_match_push(client(), nullptr, nullptr), BVMH_ERROR_INVALID_ARGUMENT);
+  EXPECT_EQ(BVMobileHelperClearVoicemailToken(client()), BVMH_OK);
+}
+
 // ---- beside blocking calls ------------------------------------------------------------------------------
 
 TEST_F(BegunCallsTest, ABlockingCallWaitsForItsTurnAndKeepsTheResultsOfTheOthers) {

@@ -64,6 +64,8 @@ extern "C" const char* bvmh_error_text(int32_t code) {
       return "not a property list, or one beyond a limit";
     case BVMH_ERROR_AMBIGUOUS:
       return "the push could answer more than one question";
+    case BVMH_ERROR_NAME_LOST:
+      return "the service's socket file is gone";
     case BVMH_ERROR_NOT_ASKED:
       return "the push answers no question of this client";
     default:

@@ -75,11 +75,12 @@ enum {
 
   /* the transport's own */
   BVMH_ERROR_FIRST = -7099,
-  BVMH_ERROR_NOT_ASKED = -7019,       /* push: no question of this client is under way that it could answer */
-  BVMH_ERROR_AMBIGUOUS = -7018,       /* push: more than one question is under way that it could answer */
-  BVMH_ERROR_NOT_A_VALUE = -7017,     /* value: the bytes are no property list, or one beyond a limit */
-  BVMH_ERROR_NO_SUCH_CALL = -7016,    /* begun call: cancelled, its result was taken, or never begun */
-  BVMH_ERROR_IN_PROGRESS = -7015,     /* begun call: there is no result yet */
+  BVMH_ERROR_NAME_LOST = -7020,    /* listener: its socket file is gone; nobody can connect to it any more */
+  BVMH_ERROR_NOT_ASKED = -7019,    /* push: no question of this client is under way that it could answer */
+  BVMH_ERROR_AMBIGUOUS = -7018,    /* push: more than one question is under way that it could answer */
+  BVMH_ERROR_NOT_A_VALUE = -7017,  /* value: the bytes are no property list, or one beyond a limit */
+  BVMH_ERROR_NO_SUCH_CALL = -7016, /* begun call: cancelled, its result was taken, or never begun */
+  BVMH_ERROR_IN_PROGRESS = -7015,  /* begun call: there is no result yet */
   BVMH_ERROR_TOO_MANY_CALLS = -7014,  /* begun call: BVMH_MOST_CALLS are there already; nothing was sent */
   BVMH_ERROR_INTERRUPTED = -7013,     /* bvmh_client_interrupt; what was sent may still be carried out */
   BVMH_ERROR_NOT_HANDED_OVER = -7012, /* listener: the service manager gave this process no such socket */
@@ -522,6 +523,8 @@ typedef struct bvmh_event {
  * Waits for the next push or notification, at most so many milliseconds (negative: for ever), and hands it
  * over; the caller frees it with bvmh_event_free. BVMH_ERROR_TIMED_OUT when none came; the event is
  * then empty. Messages that break the protocol are answered as the protocol says, and skipped.
+ * BVMH_ERROR_NAME_LOST, once for each: somebody has removed a socket file that bvmh_listener_create made, or
+ * its folder. What is connected is still served; to be found again, free the listener and create another one.
  */
 BVMH_API BVMH_CHECKED int32_t bvmh_listener_next(bvmh_listener* listener, int timeout_ms, bvmh_event* event);
 /* Answers a push: error code 0 is success. BVMH_ERROR_NO_LONGER_THERE when the helper no longer waits. */
