@@ -1,7 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <gtest/gtest.h>
+#include <poll.h>
 
+#include <algorithm>
 #include <brenvik/mobile_helper.hpp>
 #include <cerrno>
 #include <filesystem>
@@ -276,6 +278,117 @@ TEST(CppFaceTest, WithoutSocketsOfTheServiceManagerThereIsNoListener) {
   const auto listener = bvmh::Listener::fromEnvironment();
   ASSERT_FALSE(listener);
   EXPECT_EQ(listener.error().code(), BVMH_ERROR_NOT_HANDED_OVER);
+}
+
+TEST(CppFaceTest, ValuesGoThereAndBack) {
+  auto value = bvmh::Value::dictionary();
+  EXPECT_TRUE(value.set("text", bvmh::Value::text("gr\u00fcn")));
+  EXPECT_TRUE(value.set("number", bvmh::Value::integer(-3)));
+  EXPECT_TRUE(value.set("large", bvmh::Value::unsignedInteger(UINT64_MAX)));
+  EXPECT_TRUE(value.set("real", bvmh::Value::real(0.5)));
+  EXPECT_TRUE(value.set("yes", bvmh::Value::boolean(true)));
+  EXPECT_TRUE(value.set("data", bvmh::Value::data("raw")));
+  const std::chrono::system_clock::time_point when{std::chrono::seconds(1'000'000'000)};
+  EXPECT_TRUE(value.set("date", bvmh::Value::date(when)));
+  EXPECT_TRUE(value.set("list", bvmh::Value::texts({"a", "b"})));
+  const auto bytes = value.write();
+  ASSERT_TRUE(bytes);
+  const auto read = bvmh::valueOf(*bytes);
+  ASSERT_TRUE(read);
+  EXPECT_EQ(read->type(), BVMH_VALUE_DICTIONARY);
+  EXPECT_EQ(read->size(), 8u);
+  EXPECT_EQ(read->find("text").asText(), "gr\u00fcn");
+  EXPECT_EQ(read->find("number").asInteger(), -3);
+  EXPECT_EQ(read->find("large").asUnsigned(), UINT64_MAX);
+  EXPECT_EQ(read->find("large").asInteger(), std::nullopt);
+  EXPECT_EQ(read->find("real").asReal(), 0.5);
+  EXPECT_EQ(read->find("yes").asBoolean(), true);
+  EXPECT_EQ(read->find("date").asDate(), when);
+  const bvmh::Value data = read->find("data");
+  ASSERT_TRUE(data.asData());
+  EXPECT_EQ(data.asData()->size(), 3u);
+  EXPECT_EQ(read->find("list").at(1).asText(), "b");
+  EXPECT_TRUE(read->keyAt(0));
+  EXPECT_EQ(read->keyAt(8), std::nullopt);
+  EXPECT_EQ(read->find("none").type(), BVMH_VALUE_NONE);
+  EXPECT_EQ(read->find("text").asInteger(), std::nullopt);
+}
+
+TEST(CppFaceTest, AValueThatIsNoneIsRefusedAndACopyIsIndependent) {
+  auto list = bvmh::Value::array();
+  const auto appended = list.append(bvmh::Value::text("\xff"));
+  ASSERT_FALSE(appended);
+  EXPECT_EQ(appended.error().code(), BVMH_ERROR_INVALID_ARGUMENT);
+  bvmh::Value copy = list;
+  EXPECT_TRUE(copy.append(bvmh::Value::integer(1)));
+  EXPECT_EQ(list.size(), 0u);
+  EXPECT_EQ(copy.size(), 1u);
+  EXPECT_FALSE(bvmh::Value().write());
+  EXPECT_EQ(bvmh::Value::read("no list").error().code(), BVMH_ERROR_NOT_A_VALUE);
+  EXPECT_EQ(bvmh::Value::texts({"a", "\xff"}).type(), BVMH_VALUE_NONE);
+}
+
+// Processes until the outcome of that call is there.
+std::optional<bvmh::Outcome> outcomeOf(bvmh::Client& client, bvmh_call call) {
+  for (;;) {
+    auto taken = client.take(call);
+    if (!taken) return std::nullopt;
+    if (*taken) return std::move(*taken);
+    pollfd ready{client.descriptor(), POLLIN, 0};
+    if (::poll(&ready, 1, 60'000) != 1) return std::nullopt;
+    client.process();
+  }
+}
+
+TEST(CppFaceTest, CallsAreBegunAndTakenInAnyOrder) {
+  ScriptedHelper helper([](Script& script) {
+    const UniqueFd channel = script.checkIn();
+    script.send(channel, text(64)(script.receive(channel)));
+    script.send(channel, statusReply(script.receive(channel), 9));
+    script.send(channel, region(script.receive(channel)));
+    script.expectEnd(channel);
+  });
+  {
+    auto client = bvmh::Client::unconnected({.socket = helper.path().c_str()});
+    ASSERT_TRUE(client);
+    EXPECT_FALSE(client->beginClearVoicemailToken());  // neither connected nor begun to
+    int context = 0;
+    ASSERT_TRUE(client->beginConnect());
+    const auto country = client->beginCopyCountryCode(&context);
+    const auto missing = client->beginLoadPlistFile("/etc/none");
+    const auto found = client->beginCopyPreferenceValue("d", "k");
+    ASSERT_TRUE(country && missing && found);
+
+    auto last = outcomeOf(*client, *found);
+    ASSERT_TRUE(last);
+    EXPECT_TRUE(last->done());
+    EXPECT_EQ(last->takeRegion().text(), "<plist/>");
+    EXPECT_TRUE(last->takeRegion().empty());
+    const auto first = outcomeOf(*client, *country);
+    ASSERT_TRUE(first);
+    EXPECT_STREQ(first->text(), "DE");
+    EXPECT_EQ(first->context(), &context);
+    EXPECT_EQ(first->messageId(), 8683568);
+    const auto second = outcomeOf(*client, *missing);
+    ASSERT_TRUE(second);
+    EXPECT_EQ(second->done().error().code(), BVMH_MEMORY_FAILURE);
+    // Its result was taken.
+    EXPECT_EQ(client->take(*missing).error().code(), BVMH_ERROR_NO_SUCH_CALL);
+    EXPECT_EQ(client->cancel(*missing).error().code(), BVMH_ERROR_NO_SUCH_CALL);
+  }
+}
+
+TEST(CppFaceTest, AnInterruptedCallSaysSo) {
+  ScriptedHelper helper([](Script& script) {
+    const UniqueFd channel = script.checkIn();
+    script.expectEnd(channel);
+  });
+  auto client = bvmh::Client::connect({.socket = helper.path().c_str()});
+  ASSERT_TRUE(client);
+  client->interrupt();
+  const auto cleared = client->clearVoicemailToken();
+  ASSERT_FALSE(cleared);
+  EXPECT_EQ(cleared.error().code(), BVMH_ERROR_INTERRUPTED);
 }
 
 }  // namespace

@@ -23,6 +23,7 @@
 #include <cstdint>
 #include <cstdlib>
 #include <exception>
+#include <initializer_list>
 #include <memory>
 #include <new>
 #include <optional>
@@ -234,6 +235,156 @@ class Region {
   bvmh_region region_{};
 };
 
+// A property list: what preferences, labels, files, pushes and notifications are made of. Copies cost little,
+// and later changes of one are not seen in another. A value that could not be made (no memory, or a text that
+// is not UTF-8) has the type BVMH_VALUE_NONE; what is done with it fails.
+class Value {
+ public:
+  Value() noexcept = default;
+  explicit Value(bvmh_value* owned) noexcept : value_(owned) {}
+  Value(const Value& other) noexcept : value_(bvmh_value_copy(other.value_)) {}
+  Value(Value&& other) noexcept : value_(std::exchange(other.value_, nullptr)) {}
+  Value& operator=(Value other) noexcept {
+    std::swap(value_, other.value_);
+    return *this;
+  }
+  ~Value() { bvmh_value_free(value_); }
+
+  static Value boolean(bool value) noexcept { return Value(bvmh_value_new_boolean(value)); }
+  static Value integer(std::int64_t value) noexcept { return Value(bvmh_value_new_integer(value)); }
+  static Value unsignedInteger(std::uint64_t value) noexcept { return Value(bvmh_value_new_unsigned(value)); }
+  static Value real(double value) noexcept { return Value(bvmh_value_new_real(value)); }
+  static Value text(Text text) noexcept { return Value(bvmh_value_new_text(text.get())); }
+  static Value data(Bytes bytes) noexcept { return Value(bvmh_value_new_data(bytes.data(), bytes.size())); }
+  static Value date(std::chrono::system_clock::time_point when) noexcept {
+    return Value(bvmh_value_new_date(std::chrono::duration<double>(when.time_since_epoch()).count()));
+  }
+  static Value array() noexcept { return Value(bvmh_value_new_array()); }
+  static Value dictionary() noexcept { return Value(bvmh_value_new_dictionary()); }
+  // Arrays of texts: labels and languages.
+  static Value texts(std::initializer_list<Text> texts) noexcept {
+    Value list = array();
+    for (const Text& each : texts) {
+      if (!list.append(text(each))) return Value();
+    }
+    return list;
+  }
+
+  // An element behind the last one, or the value under a key. What they fail for stands in mobile_helper.h.
+  Result<void> append(Value element) noexcept {
+    return resultOf(bvmh_value_append(value_, std::exchange(element.value_, nullptr)));
+  }
+  Result<void> set(Text key, Value value) noexcept {
+    return resultOf(bvmh_value_set(value_, key.get(), std::exchange(value.value_, nullptr)));
+  }
+
+  bvmh_value_type type() const noexcept { return bvmh_value_type_of(value_); }
+  // The number of elements or entries; 0 for other types.
+  std::size_t size() const noexcept { return bvmh_value_count(value_); }
+  // An element, or the value of an entry, in order; BVMH_VALUE_NONE where there is none.
+  Value at(std::size_t index) const noexcept { return Value(bvmh_value_at(value_, index)); }
+  std::optional<std::string> keyAt(std::size_t index) const {
+    return copied(bvmh_value_key_at(value_, index));
+  }
+  // The value under a key; BVMH_VALUE_NONE where there is none.
+  Value find(Text key) const noexcept { return Value(bvmh_value_find(value_, key.get())); }
+
+  // Nothing when the value is of another type, or does not fit.
+  std::optional<bool> asBoolean() const noexcept { return got<bool>(bvmh_value_get_boolean); }
+  std::optional<std::int64_t> asInteger() const noexcept { return got<std::int64_t>(bvmh_value_get_integer); }
+  std::optional<std::uint64_t> asUnsigned() const noexcept {
+    return got<std::uint64_t>(bvmh_value_get_unsigned);
+  }
+  std::optional<double> asReal() const noexcept { return got<double>(bvmh_value_get_real); }
+  std::optional<std::string> asText() const {
+    std::size_t length = 0;
+    const char* text = bvmh_value_get_text(value_, &length);
+    return text == nullptr ? std::nullopt : std::optional<std::string>(std::in_place, text, length);
+  }
+  // They live as long as the value.
+  std::optional<std::span<const std::byte>> asData() const noexcept {
+    std::size_t size = 0;
+    const void* bytes = bvmh_value_get_data(value_, &size);
+    if (bytes == nullptr) return std::nullopt;
+    return std::span(static_cast<const std::byte*>(bytes), size);
+  }
+  std::optional<std::chrono::system_clock::time_point> asDate() const noexcept {
+    const auto seconds = got<double>(bvmh_value_get_date);
+    // What a clock of ours cannot hold is none.
+    if (!seconds || !(*seconds > -9.2e9 && *seconds < 9.2e9)) return std::nullopt;
+    return std::chrono::system_clock::time_point(
+        std::chrono::duration_cast<std::chrono::system_clock::duration>(
+            std::chrono::duration<double>(*seconds)));
+  }
+
+  // XML or binary.
+  static Result<Value> read(Bytes bytes) {
+    bvmh_value* value = nullptr;
+    const std::int32_t code = bvmh_value_read(bytes.data(), bytes.size(), &value);
+    if (code != BVMH_OK) return Failed(Error(code));
+    return Value(value);
+  }
+  // As every routine takes it.
+  Result<Region> write() const {
+    bvmh_region bytes{};
+    const std::int32_t code = bvmh_value_write(value_, &bytes);
+    if (code != BVMH_OK) return Failed(Error(code));
+    return Region(bytes);
+  }
+
+  bvmh_value* get() const noexcept { return value_; }
+
+ private:
+  static Result<void> resultOf(std::int32_t code) noexcept {
+    if (code != BVMH_OK) return Failed(Error(code));
+    return {};
+  }
+  static std::optional<std::string> copied(const char* text) {
+    return text == nullptr ? std::nullopt : std::optional<std::string>(text);
+  }
+  template <class T>
+  std::optional<T> got(bool (*ask)(const bvmh_value*, T*)) const noexcept {
+    T value{};
+    return ask(value_, &value) ? std::optional<T>(value) : std::nullopt;
+  }
+
+  bvmh_value* value_ = nullptr;
+};
+
+// Values of what came. BVMH_ERROR_NOT_A_VALUE for an empty region.
+inline Result<Value> valueOf(const Region& region) { return Value::read(region.bytes()); }
+
+// How a call went that was begun.
+class Outcome {
+ public:
+  explicit Outcome(bvmh_result owned) noexcept : result_(owned) {}
+  Outcome(Outcome&& other) noexcept : result_(std::exchange(other.result_, bvmh_result{})) {}
+  Outcome& operator=(Outcome&& other) noexcept {
+    if (this != &other) {
+      bvmh_result_free(&result_);
+      result_ = std::exchange(other.result_, bvmh_result{});
+    }
+    return *this;
+  }
+  ~Outcome() { bvmh_result_free(&result_); }
+
+  bvmh_call call() const noexcept { return result_.call; }
+  void* context() const noexcept { return result_.context; }
+  std::int32_t messageId() const noexcept { return result_.message_id; }
+  // Whether it was done, or why not.
+  Result<void> done() const {
+    if (result_.code != BVMH_OK) return Failed(Error(result_.code, result_.system_error));
+    return {};
+  }
+  // What its routine answers; empty for other routines, and when it was not done.
+  bool boolean() const noexcept { return result_.boolean; }
+  const char* text() const noexcept { return result_.text; }
+  Region takeRegion() noexcept { return Region(std::exchange(result_.region, bvmh_region{})); }
+
+ private:
+  bvmh_result result_{};
+};
+
 // Where to find the helper, and how long a call may take in all. For Client::connect.
 struct Options {
   const char* socket = nullptr;          // for tests; null: the place compiled into the library
@@ -292,6 +443,11 @@ class Client {
   // ---- preferences ----
   Result<void> setPreferenceValue(Text domain, Text key, Bytes value) {
     return done(BVMobileHelperSetPreferenceValue(get(), domain.get(), key.get(), value.data(), value.size()));
+  }
+  Result<void> setPreferenceValue(Text domain, Text key, const Value& value) {
+    const auto bytes = value.write();
+    if (!bytes) return Failed(bytes.error());
+    return setPreferenceValue(domain, key, Bytes(bytes->bytes()));
   }
   Result<void> removePreferenceValue(Text domain, Text key) {
     return done(BVMobileHelperSetPreferenceValue(get(), domain.get(), key.get(), "", 1));
@@ -369,6 +525,18 @@ class Client {
                                                                 languages.data(), languages.size(), &names);
     return region(code, names);
   }
+  Result<Region> copyBadgeLabels(const Value& labels, const Value& languages) {
+    const auto first = labels.write();
+    const auto second = languages.write();
+    if (!first || !second) return Failed(first ? second.error() : first.error());
+    return copyBadgeLabels(Bytes(first->bytes()), Bytes(second->bytes()));
+  }
+  Result<Region> copyLocalizedLabels(const Value& labels, const Value& languages) {
+    const auto first = labels.write();
+    const auto second = languages.write();
+    if (!first || !second) return Failed(first ? second.error() : first.error());
+    return copyLocalizedLabels(Bytes(first->bytes()), Bytes(second->bytes()));
+  }
   Result<bool> remapContactsChannel(Text from, Text to) {
     bool answer = false;
     const std::int32_t code = BVMobileHelperRemapContactsChannel(get(), from.get(), to.get(), &answer);
@@ -385,6 +553,194 @@ class Client {
     return done(BVMobileHelperEnableRadioManagerLogs(get(), on ? 1 : 0));
   }
 
+  // ---- calls that do not block: begun here, and finished when take() hands out their outcome ----
+
+  // A client that has not checked in, for beginConnect().
+  static Result<Client> unconnected(const Options& options = {}) {
+    Client client(bvmh_client_create());
+    if (!client.client_) return Failed(Error(BVMH_ERROR_NO_MEMORY));
+    client.setTimeout(options.timeout);
+    if (options.socket == nullptr) return client;
+    const std::int32_t code = bvmh_client_set_socket(client.get(), options.socket);
+    if (code != BVMH_OK) return Failed(Error(code));
+    return client;
+  }
+  // Readable when process() has something to do; -1 when it could not be made.
+  int descriptor() noexcept { return bvmh_client_fd(get()); }
+  void process() noexcept { (void)bvmh_process(get()); }
+  // The outcome of a call, or for 0 of the one that finished first; nothing when there is none yet.
+  Result<std::optional<Outcome>> take(bvmh_call call = 0) {
+    bvmh_result result{};
+    const std::int32_t code = bvmh_take_result(get(), call, &result);
+    Outcome owned(result);
+    if (code == BVMH_ERROR_IN_PROGRESS || (call == 0 && code == BVMH_ERROR_NO_SUCH_CALL))
+      return std::optional<Outcome>();
+    if (code != BVMH_OK) return Failed(Error(code));
+    return std::optional<Outcome>(std::move(owned));
+  }
+  Result<void> cancel(bvmh_call call) { return done(bvmh_cancel(get(), call)); }
+  // Makes the blocking call that is under way return BVMH_ERROR_INTERRUPTED. From any thread or signal
+  // handler.
+  void interrupt() noexcept { bvmh_client_interrupt(get()); }
+  Result<bvmh_call> beginConnect(void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = bvmh_begin_connect(get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginSetVoicemailToken(Text token, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperSetVoicemailTokenBegin(get(), token.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginSetVoicemailTokenForKey(Text key, Text token, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code =
+        BVMobileHelperSetVoicemailTokenForKeyBegin(get(), key.get(), token.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginClearVoicemailToken(void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperClearVoicemailTokenBegin(get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginResetVoicemailStore(void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperResetVoicemailStoreBegin(get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCopyVoicemailTokenForKey(Text key, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperCopyVoicemailTokenForKeyBegin(get(), key.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCopyVoicemailToken(void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperCopyVoicemailTokenBegin(get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginIsVoicemailServiceSubscribed(void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperIsVoicemailServiceSubscribedBegin(get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginSetPreferenceValue(Text domain, Text key, Bytes value, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperSetPreferenceValueBegin(
+        get(), domain.get(), key.get(), value.data(), value.size(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCopyPreferenceValue(Text domain, Text key, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code =
+        BVMobileHelperCopyPreferenceValueBegin(get(), domain.get(), key.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCopyAppPreferenceValue(Text domain, Text key, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code =
+        BVMobileHelperCopyAppPreferenceValueBegin(get(), domain.get(), key.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginLoadPlistFile(Text path, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperLoadPlistFileBegin(get(), path.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginReplaceCarrierSymlink(Text target, Text linkPath, Text domain,
+                                               void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperReplaceCarrierSymlinkBegin(get(), target.get(), linkPath.get(),
+                                                                       domain.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCreateSymlink(Text target, Text linkPath, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code =
+        BVMobileHelperCreateSymlinkBegin(get(), target.get(), linkPath.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginRemoveCarrierFile(Text path, Text domain, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code =
+        BVMobileHelperRemoveCarrierFileBegin(get(), path.get(), domain.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCopyCarrierFile(Text sourceDirectory, Text destinationDirectory, Text fileName,
+                                         void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperCopyCarrierFileBegin(
+        get(), sourceDirectory.get(), destinationDirectory.get(), fileName.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCopyCrashLogs(Text path, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperCopyCrashLogsBegin(get(), path.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginMoveIntoCarrierBundles(Text sourcePath, Text destinationDirectory, Text name,
+                                                void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperMoveIntoCarrierBundlesBegin(
+        get(), sourcePath.get(), destinationDirectory.get(), name.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginUnpackArchive(Text archivePath, Text destinationPath, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code =
+        BVMobileHelperUnpackArchiveBegin(get(), archivePath.get(), destinationPath.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginRequestCountryCodeFromLocation(double latitude, double longitude,
+                                                        void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code =
+        BVMobileHelperRequestCountryCodeFromLocationBegin(get(), latitude, longitude, context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginRequestWanIpFromLocation(void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperRequestWanIPFromLocationBegin(get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCopyCountryCode(void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperCopyCountryCodeBegin(get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCopyBadgeLabels(Bytes labels, Bytes languages, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperCopyBadgeLabelsBegin(
+        get(), labels.data(), labels.size(), languages.data(), languages.size(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCopyLocalizedLabels(Bytes labels, Bytes languages, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperCopyLocalizedLabelsBegin(
+        get(), labels.data(), labels.size(), languages.data(), languages.size(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginRemapContactsChannel(Text from, Text to, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code =
+        BVMobileHelperRemapContactsChannelBegin(get(), from.get(), to.get(), context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCellularHeartbeat(bool on, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperCellularHeartbeatBegin(get(), on ? 1 : 0, context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginCheckLasdUpdate(std::int32_t databases, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperCheckLASDUpdateBegin(get(), databases, context, &call);
+    return begun(code, call);
+  }
+  Result<bvmh_call> beginEnableRadioManagerLogs(bool on, void* context = nullptr) {
+    bvmh_call call = 0;
+    const std::int32_t code = BVMobileHelperEnableRadioManagerLogsBegin(get(), on ? 1 : 0, context, &call);
+    return begun(code, call);
+  }
+
  private:
   struct Free {
     void operator()(bvmh_client* client) const noexcept { bvmh_client_free(client); }
@@ -395,6 +751,10 @@ class Client {
   Result<void> done(std::int32_t code) const {
     if (code != BVMH_OK) return Failed(errorOf(code));
     return {};
+  }
+  Result<bvmh_call> begun(std::int32_t code, bvmh_call call) const {
+    if (code != BVMH_OK) return Failed(errorOf(code));
+    return call;
   }
   Result<bool> boolean(std::int32_t code, bool answer) const {
     if (code != BVMH_OK) return Failed(errorOf(code));
@@ -435,6 +795,7 @@ class Event {
   std::span<const std::byte> payload() const noexcept {
     return {static_cast<const std::byte*>(event_.payload.bytes), event_.payload.size};
   }
+  Result<Value> values() const { return Value::read(payload()); }
   // The text under a key, "CountryCode" for instance; nothing when the key is absent or is no text.
   std::optional<std::string> text(Text key) const {
     const std::ptrdiff_t length = bvmh_event_text(&event_, key.get(), nullptr, 0);
