@@ -131,9 +131,10 @@ class InstalledClient(unittest.TestCase):
     def test_every_program_of_the_page_about_cpp_prints_what_stands_below_it(self):
         page = (SOURCE / "docs" / "cpp.md").read_text()
         programs = re.findall(r"^```cpp\n(.*?)^```\n```text\n(.*?)^```$", page, re.M | re.S)
-        self.assertEqual(len(programs), 2)
+        self.assertEqual(len(programs), 4)
         script = self.folder / "script"
         script.write_text('on SetVoicemailToken\non CopyCountryCode\n answer "NO"\non LoadPlistFile\n fail 9\n'
+                          'on SetPreferenceValue value={"text": "Hello"}\non CopyLocalizedLabels\n answer ["Reise"]\n'
                           'on RequestCountryCodeFromLocation\n push civic-info City="Oslo"\n')
         for number, (code, expected) in enumerate(programs):
             source, program = self.folder / f"page-{number}.cpp", self.folder / f"page-{number}"

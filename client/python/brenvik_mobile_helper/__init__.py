@@ -12,7 +12,7 @@ AsyncClient and AsyncListener are the same for asyncio. docs/python.md of the pr
 from ._build import VERSION as __version__
 from ._client import Client, service_socket
 from ._errors import (AnswerLostError, Error, HelperError, HelperGoneError, InvalidArgumentError, NameInUseError,
-                      NoAccessError, NoLongerThereError, NotConnectedError, NotHandedOverError, ProtocolError, RefusedError,
+                      NameLostError, NoAccessError, NoLongerThereError, NotConnectedError, NotHandedOverError, ProtocolError, RefusedError,
                       TimedOutError, TransportError, UnreachableError, error_text)
 from ._table import LASD_BITS as DATABASES
 
@@ -23,7 +23,7 @@ if TYPE_CHECKING:
 
 __all__ = [
     "AnswerLostError", "AsyncClient", "AsyncListener", "CivicInfo", "Client", "DATABASES", "Error", "Event", "HelperError",
-    "HelperGoneError", "InvalidArgumentError", "Listener", "LocalAddress", "NameInUseError", "NoAccessError",
+    "HelperGoneError", "InvalidArgumentError", "Listener", "LocalAddress", "NameInUseError", "NameLostError", "NoAccessError",
     "NoLongerThereError", "NotConnectedError", "NotHandedOverError", "Notification", "ProtocolError", "RefusedError",
     "TimedOutError", "TransportError", "UnreachableError", "error_text", "service_socket"]
 

@@ -4,6 +4,7 @@
 from ._table import CODES
 
 _OWN = {
+    -7020: "the service's socket file is gone",
     -7012: "the service manager handed over no such socket",
     -7011: "the sender no longer waits for an answer",
     -7010: "another process serves that name",
@@ -118,6 +119,12 @@ class NotHandedOverError(TransportError):
     """The service manager gave this process no such socket."""
 
     code = -7012
+
+
+class NameLostError(TransportError):
+    """Somebody removed a socket file that the listener made, or its folder. Nobody can connect to it any more."""
+
+    code = -7020
 
 
 def answered(code: int) -> HelperError:

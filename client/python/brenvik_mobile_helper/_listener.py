@@ -10,7 +10,7 @@ from time import monotonic
 
 from . import _wire
 from ._build import BOOTSTRAP_DIRECTORY
-from ._errors import InvalidArgumentError, NameInUseError, NoLongerThereError, NotHandedOverError
+from ._errors import InvalidArgumentError, NameInUseError, NameLostError, NoLongerThereError, NotHandedOverError
 from ._table import (BAD_ARGUMENTS, BAD_ID, COMPLEX, DESCRIPTORS, LARGEST, NDR, NOTIFICATION_ID, NOTIFICATION_SERVICE, PUSHES,
                      PUSH_REPLY_SIZE, PUSH_SERVICE, PUSH_SIZE, REPLY_ID, TYPE_ERROR, OUT_OF_LINE)
 
@@ -144,16 +144,38 @@ class _Service:
         self.path = path
         facts = os.stat(path, follow_symlinks=False) if path else None
         self.file = facts and (facts.st_dev, facts.st_ino)
+        self.has_lost_name = False
+
+    @property
+    def is_named(self) -> bool:
+        try:
+            facts = os.stat(self.path or "", follow_symlinks=False)
+        except OSError:
+            return False
+        return (facts.st_dev, facts.st_ino) == self.file
 
     def close(self):
         self.sock.close()
-        if self.path:
+        if self.path and self.is_named:
             try:
-                facts = os.stat(self.path, follow_symlinks=False)
-                if (facts.st_dev, facts.st_ino) == self.file:
-                    os.unlink(self.path)
+                os.unlink(self.path)
             except OSError:
                 pass
+
+
+def _watch_names(paths: list[str]) -> int:
+    """An inotify descriptor that is readable when something happens to one of the files; -1 when there can be none, and
+    then a lost name is not noticed."""
+    import ctypes  # Python itself has no inotify
+    library = ctypes.CDLL(None)
+    try:
+        watch = library.inotify_init1(os.O_CLOEXEC | os.O_NONBLOCK)
+        for each in paths if watch >= 0 else ():
+            # IN_ATTRIB, which a removed file that is open still gets, IN_MOVE_SELF, IN_DELETE_SELF, IN_DONT_FOLLOW
+            library.inotify_add_watch(watch, os.fsencode(each), 0x4 | 0x800 | 0x400 | 0x2000000)
+    except AttributeError:
+        return -1
+    return watch
 
 
 def listening_socket(path: str) -> socket.socket:
@@ -221,7 +243,7 @@ class Listener:
         except BaseException:
             for each in services.values():
                 each.close()
-            self._poll.close()
+            self.close()
             raise
 
     @classmethod
@@ -278,6 +300,7 @@ class Listener:
         self._answer = bool(answer)
         self._allowed = {0, os.geteuid()} | ({allowed_uid} if allowed_uid is not None else set())
         self._poll = select.epoll()
+        self._names = -1
         self._services: dict[int, tuple[str, _Service]] = {}
         self._connections: dict[int, tuple[socket.socket, str, int, int]] = {}  # the oldest first
 
@@ -287,6 +310,11 @@ class Listener:
         for name, each in services.items():
             self._poll.register(each.sock, select.EPOLLIN)
             self._services[each.sock.fileno()] = name, each
+        paths = [each.path for each in services.values() if each.path]
+        if paths:
+            self._names = _watch_names(paths)
+            if self._names >= 0:
+                self._poll.register(self._names, select.EPOLLIN)
 
     def __enter__(self):
         return self
@@ -315,9 +343,13 @@ class Listener:
             each.close()
         self._services.clear()
         self._poll.close()
+        if self._names >= 0:
+            os.close(self._names)
+            self._names = -1
 
     def next(self, timeout: float | None = None) -> Event | None:
-        """Waits for the next event, at most so many seconds (None: for ever); None when none came."""
+        """Waits for the next event, at most so many seconds (None: for ever); None when none came. NameLostError, once for
+        each, when somebody has removed a socket file that it made; what is connected is still served."""
         deadline = None if timeout is None else monotonic() + timeout
         overtime = 0
         while True:
@@ -335,7 +367,25 @@ class Listener:
                 if overtime > 2 * _MOST_CONNECTIONS:
                     return None
 
+    def _look_for_names(self) -> None:
+        try:
+            while os.read(self._names, 4096):
+                pass
+        except BlockingIOError:
+            pass
+        lost = []
+        for _, each in self._services.values():
+            is_lost = each.path is not None and not each.is_named
+            if is_lost and not each.has_lost_name:
+                lost.append(each.path)
+            each.has_lost_name = is_lost
+        if lost:
+            raise NameLostError(detail=", ".join(map(str, lost)))
+
     def _handle(self, descriptor: int) -> Event | None:
+        if descriptor == self._names:
+            self._look_for_names()
+            return None
         service = self._services.get(descriptor)
         if service is not None:
             self._accept(*service)

@@ -71,7 +71,7 @@ class Pages(unittest.TestCase):
         import brenvik_mobile_helper as package
         text = (DOCS / "python.md").read_text()
         for name in package.__all__:
-            if name.endswith("Error") and name not in ("Error", "TransportError", "NameInUseError", "NoLongerThereError",
+            if name.endswith("Error") and name not in ("Error", "TransportError", "NameInUseError", "NameLostError", "NoLongerThereError",
                                                        "NotHandedOverError"):
                 self.assertIn(f"`{name}`", text)
 

@@ -212,11 +212,35 @@ class Sockets(support.InFolder):
             Listener(self.folder)
         self.assertEqual((self.folder / PUSHES).read_text(), "somebody's")
 
-    def test_the_folder_may_vanish(self):
-        listener = Listener(self.folder / "folder")
-        shutil.rmtree(self.folder / "folder")
-        self.assertIsNone(listener.next(0))
-        listener.close()
+    def test_a_folder_that_vanished_is_told_once_and_who_is_connected_is_still_served(self):
+        folder = self.folder / "folder"
+        with Listener(folder) as listener, support.connected(folder / PUSHES) as sender:
+            self.assertIsNone(listener.next(0))
+            os.chmod(folder / PUSHES, 0o600)  # which is no loss
+            self.assertIsNone(listener.next(0))
+            shutil.rmtree(folder)
+            with self.assertRaises(package.NameLostError) as caught:
+                listener.next(20)
+            self.assertIn(str(folder / PUSHES), str(caught.exception))
+            self.assertIsNone(listener.next(0))
+            sender.send(support.push_message(CIVIC, plist(City="Oslo")))
+            self.assertEqual(listener.next(20).city, "Oslo")
+
+        async def work():
+            async with package.AsyncListener(folder) as listener:
+                asyncio.get_running_loop().call_later(0.01, shutil.rmtree, folder)
+                with self.assertRaises(package.NameLostError):
+                    await anext(listener)
+
+        asyncio.run(work())
+
+    def test_no_descriptor_is_lost(self):
+        def work():
+            Listener(self.folder).close()
+            with Listener(self.folder), self.assertRaises(package.NameInUseError):
+                Listener(self.folder)
+
+        self.expect_no_descriptor_lost(work)
 
     def test_a_file_of_somebody_else_stays(self):
         listener = Listener(self.folder)
