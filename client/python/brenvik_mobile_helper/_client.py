@@ -202,6 +202,8 @@ class Client(Routines):
 
     def _send_and_wait(self, channel: socket.socket, message: bytes, memories, port: int, room: int, start: float):
         """The answer's bytes, its descriptors, and whether it was cut."""
+        # Noted before it is sent: a signal handler may raise right after.
+        self._unanswered.add(port)
         # The socket blocks, but each call says that it must not: a time-out of Python's own would cost two system calls more.
         while True:
             try:
@@ -214,7 +216,6 @@ class Client(Routines):
                 self._wait(channel, select.POLLOUT, start)
             except (BrokenPipeError, ConnectionResetError) as error:
                 raise HelperGoneError from error
-        self._unanswered.add(port)
         while True:
             self._wait(channel, select.POLLIN, start)
             try:
