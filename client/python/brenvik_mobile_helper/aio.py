@@ -34,7 +34,8 @@ class AsyncClient(AsyncRoutines):
         self._connecting: asyncio.Lock | None = None
         self._last_port = 0
         self._pending: dict[int, tuple[Routine, asyncio.Future]] = {}  # by reply port, in the order they were sent
-        self._waiting: deque[asyncio.Future] = deque()  # for room in the channel
+        # What the channel had no room for yet: reply port, routine, message, its descriptors, and who waits.
+        self._outgoing: deque[tuple[int, Routine, bytes, tuple | list, asyncio.Future]] = deque()
         self._loop: asyncio.AbstractEventLoop | None = None
         self._closed = False
 
@@ -53,16 +54,21 @@ class AsyncClient(AsyncRoutines):
     async def connect(self) -> None:
         """Checks in, unless that was done already. A closed client can be used again after it."""
         self._closed = False
-        async with self._timed():
-            await self._connect()
+        await self._connect_until(asyncio.get_running_loop().time() + self._timeout)
 
     def close(self) -> None:
         """Leaves the helper. Calls under way end with NotConnectedError."""
         self._closed = True
         self._drop(lambda _: NotConnectedError())
 
-    def _timed(self):
-        return _Timed(self._timeout)
+    async def _connect_until(self, end: float) -> bool:
+        try:
+            async with asyncio.timeout_at(end):
+                return await self._connect()
+        except TimedOutError:
+            raise
+        except TimeoutError as error:
+            raise TimedOutError from error
 
     async def _connect(self):
         """True when it had to check in."""
@@ -101,13 +107,10 @@ class AsyncClient(AsyncRoutines):
         for number, (_, future) in enumerate(pending):
             if not future.done():
                 future.set_exception(failure(number))
-        self._wake()
-
-    def _wake(self):
-        while self._waiting:
-            future = self._waiting.popleft()
+        unsent, self._outgoing = self._outgoing, deque()
+        for *_, future in unsent:
             if not future.done():
-                future.set_result(None)
+                future.set_exception(NotConnectedError() if self._closed else HelperGoneError())
 
     def _read(self):
         descriptors: list[int] = []
@@ -146,58 +149,54 @@ class AsyncClient(AsyncRoutines):
         finally:
             _wire.close_all(descriptors)
 
-    def _writable(self):
-        self._loop.remove_writer(self._channel.fileno())
-        self._wake()
-
-    async def _send(self, message, memories):
-        """Sends when there is room; True when the channel that it was meant for is still there."""
-        while True:
-            channel = self._channel
-            if channel is None:
-                return False
-            if not self._waiting or self._waiting[0].done():
+    def _flush(self):
+        """Sends what there is room for."""
+        channel = self._channel
+        while self._outgoing:
+            port, routine, message, memories, future = self._outgoing[0]
+            if not future.done():
                 try:
                     if memories:
                         socket.send_fds(channel, [message], memories, socket.MSG_NOSIGNAL)
                     else:
                         channel.send(message)
-                    return True
                 except (BlockingIOError, InterruptedError):
-                    pass
+                    self._loop.add_writer(channel.fileno(), self._flush)
+                    return
                 except OSError:
-                    # Nothing was delivered. What was sent before may have been read.
-                    self._drop(lambda _: AnswerLostError())
-                    return False
-            future = self._loop.create_future()
-            self._waiting.append(future)
-            self._loop.add_writer(channel.fileno(), self._writable)
-            await future
+                    break  # the helper has gone: what it answered before is still read, then the end is
+                self._pending[port] = routine, future
+            self._outgoing.popleft()
+        self._loop.remove_writer(channel.fileno())
 
     async def _ask(self, routine: Routine, body: bytes, memories=()):
         if self._closed:
             raise NotConnectedError
-        async with self._timed():
-            has_checked_in = False
-            while True:
-                if self._channel is None:
-                    if self._closed:
-                        raise NotConnectedError
-                    if has_checked_in:
-                        raise HelperGoneError
-                    has_checked_in = await self._connect()
-                port = self._last_port = self._last_port % 0xFFFFFFFE + 1
-                bits = _wire.COMPLEX_BITS if routine.descriptors else _wire.SIMPLE_BITS
-                message = _wire.HEADER.pack(bits, routine.request_size, port, 0, 0, routine.id) + body
-                if not await self._send(message, memories):
-                    continue
-                future = asyncio.get_running_loop().create_future()
-                self._pending[port] = routine, future
-                try:
-                    return await future
-                except HelperGoneError:
-                    if has_checked_in:
-                        raise
+        loop = asyncio.get_running_loop()
+        end = loop.time() + self._timeout
+        has_checked_in = False
+        while True:
+            if self._channel is None:
+                if has_checked_in:
+                    raise HelperGoneError
+                if self._closed:
+                    raise NotConnectedError
+                has_checked_in = await self._connect_until(end)
+            port = self._last_port = self._last_port % 0xFFFFFFFE + 1
+            bits = _wire.COMPLEX_BITS if routine.descriptors else _wire.SIMPLE_BITS
+            message = _wire.HEADER.pack(bits, routine.request_size, port, 0, 0, routine.id) + body
+            future = loop.create_future()
+            timer = loop.call_at(end, _set_late, future)
+            self._outgoing.append((port, routine, message, memories, future))
+            if len(self._outgoing) == 1:
+                self._flush()
+            try:
+                return await future
+            except HelperGoneError:
+                if has_checked_in:
+                    raise
+            finally:
+                timer.cancel()
 
     async def _ask_complex(self, routine: Routine, rest: bytes, regions):
         body, memories = _wire.with_regions(routine.request_size, rest, regions)
@@ -223,22 +222,9 @@ class AsyncClient(AsyncRoutines):
         return await (self._ask_complex(routine, rest, regions) if regions else self._ask(routine, rest))
 
 
-class _Timed:
-    """asyncio.timeout with this package's exception."""
-
-    def __init__(self, seconds):
-        self._timeout = asyncio.timeout(seconds)
-
-    async def __aenter__(self):
-        await self._timeout.__aenter__()
-
-    async def __aexit__(self, kind, error, trace):
-        try:
-            await self._timeout.__aexit__(kind, error, trace)
-        except TimeoutError as late:
-            if not isinstance(late, TimedOutError):
-                raise TimedOutError from late
-            raise
+def _set_late(future):
+    if not future.done():
+        future.set_exception(TimedOutError())
 
 
 def _close_result(work):
