@@ -35,11 +35,15 @@ struct Turns {
   int measured;
 };
 
-// What the first may take of the second's time; both by their place among the contestants.
+// What the first may take of the second's time; both by their place among the contestants. With `without`,
+// only what it takes more than that one counts.
 struct PairLimit {
+  static constexpr std::size_t kNone = static_cast<std::size_t>(-1);
+
   std::size_t ours;
   std::size_t peer;
   double most;
+  std::size_t without = kNone;
 };
 
 // Measures the contestants in turns and compares their medians round by round, so that a slow moment of the
@@ -63,12 +67,16 @@ inline bool comparePaired(const Turns& turns, const std::vector<Contestant>& con
   for (const PairLimit& limit : limits) {
     Times ratios;
     for (std::size_t round = 0; round < medians[limit.ours].size(); ++round) {
-      ratios.push_back(medians[limit.ours][round] / medians[limit.peer][round]);
+      const double base = limit.without == PairLimit::kNone ? 0 : medians[limit.without][round];
+      ratios.push_back((medians[limit.ours][round] - base) / medians[limit.peer][round]);
     }
     const double ratio = quantile(ratios, 0.5);
     const bool within = ratio <= limit.most;
-    std::printf("%s / %s: ratio %.3f, at most %.2f  %s\n", contestants[limit.ours].name.c_str(),
-                contestants[limit.peer].name.c_str(), ratio, limit.most, within ? "ok" : "ABOVE");
+    const std::string ours = limit.without == PairLimit::kNone ? contestants[limit.ours].name
+                                                               : "(" + contestants[limit.ours].name + " - " +
+                                                                     contestants[limit.without].name + ")";
+    std::printf("%s / %s: ratio %.3f, at most %.2f  %s\n", ours.c_str(), contestants[limit.peer].name.c_str(),
+                ratio, limit.most, within ? "ok" : "ABOVE");
     good = good && within;
   }
   return good;

@@ -4,15 +4,18 @@
 // What a client waits for, everything on one processor: a call to the real daemon beside a bare blocking
 // ping-pong over the same kind of socket and beside sd-bus, peer to peer; a reply with a region of all that
 // fits a datagram, through the real transport, beside a bare one of the same bytes; and the time from the
-// start of the daemon to its first answer, beside a bare server that needs the C library alone; and a call to
-// a daemon that has 4,000 clients beside one that has this client alone.
+// start of the daemon to its first answer, beside a bare server that needs the C library alone; a call to
+// a daemon that has 4,000 clients beside one that has this client alone; and what the client library adds to
+// a call, and what it saves to have 1,000 calls under way at once.
 //
 // The daemon and the bare server are programs of this build, started as a service manager starts them. The
 // daemon admits this program by an entitlement file that is written for the time being, so it wants the
 // sandbox of the end-to-end tests and not the machine itself:
 //
 //   sudo tests/e2e/sandbox build/release $PWD/build/release/bench/TransportBenchmark
+#include <brenvik/mobile_helper.h>
 #include <fcntl.h>
+#include <poll.h>
 #include <sched.h>
 #include <signal.h>
 #include <stdlib.h>
@@ -55,6 +58,9 @@ constexpr double kMostOfBareRegion = 1.15;
 constexpr double kMostOfBareStart = 1.35;
 constexpr double kMostOfOneClient = 1.1;  // a call of one among many, beside a call of the only one
 constexpr std::size_t kManyClients = 4000;
+constexpr double kMostOfLibrary = 0.15;  // of a bare ping-pong, beside a call without the library
+constexpr double kMostInFlight = 0.6;    // of as many calls one after another
+constexpr int kCallsInFlight = 1000;
 
 constexpr const char kEntitlementFile[] = "/etc/brenvik/entitlements.d/50-transport-benchmark.plist";
 
@@ -139,6 +145,7 @@ class ServedProgram {
   ServedProgram(const ServedProgram&) = delete;
   ServedProgram& operator=(const ServedProgram&) = delete;
 
+  const std::string& path() const { return path_; }
   std::size_t clients() const { return 1 + others_.size() / 2; }
   // Checks in once more and keeps the client.
   void addClient() {
@@ -339,6 +346,71 @@ bool compareCalls(const std::string& daemonPath, const std::string& barePath, in
                        {{0, 1, kMostOfBare}, {0, 2, kMostOfBus}});
 }
 
+// A client of the library, whose calls are refused at once: their token is no text.
+class LibraryClient {
+ public:
+  explicit LibraryClient(const std::string& path) : client_(bvmh_client_create()) {
+    require(bvmh_client_set_socket(client_, path.c_str()) == BVMH_OK && bvmh_connect(client_) == BVMH_OK,
+            "bvmh_connect");
+  }
+  ~LibraryClient() { bvmh_client_free(client_); }
+  LibraryClient(const LibraryClient&) = delete;
+  LibraryClient& operator=(const LibraryClient&) = delete;
+
+  double call() {
+    const auto before = Clock::now();
+    const std::int32_t code = BVMobileHelperSetVoicemailToken(client_, kToken);
+    const double time = microsecondsSince(before);
+    require(code == BVMH_FAILURE, "call");
+    return time;
+  }
+  double manyInTurn() {
+    const auto before = Clock::now();
+    for (int i = 0; i < kCallsInFlight; ++i) (void)call();
+    return microsecondsSince(before);
+  }
+  double manyInFlight() {
+    const auto before = Clock::now();
+    for (int i = 0; i < kCallsInFlight; ++i)
+      require(BVMobileHelperSetVoicemailTokenBegin(client_, kToken, nullptr, nullptr) == BVMH_OK, "begin");
+    for (int finished = 0; finished < kCallsInFlight;) {
+      pollfd ready{bvmh_client_fd(client_), POLLIN, 0};
+      require(::poll(&ready, 1, -1) == 1, "poll");
+      bvmh_process(client_);
+      for (bvmh_result result; bvmh_take_result(client_, 0, &result) == BVMH_OK; ++finished)
+        require(result.code == BVMH_FAILURE, "result");
+    }
+    return microsecondsSince(before);
+  }
+
+ private:
+  static constexpr const char* kToken = "\xFF";
+  bvmh_client* client_;
+};
+
+bool compareLibrary(const std::string& daemonPath, const std::string& barePath, int rounds) {
+  ServedProgram daemon(daemonPath);
+  ServedProgram bare(barePath);
+  LibraryClient library(daemon.path());
+  String256Request request{};
+  request.header = {kReplyDisposition, sizeof request, 1, 0, 0, kFirstRequestId};
+  request.ndr = kNdrRecord;
+  request.text[0] = '\xFF';
+  const auto callOf = [&request](ServedProgram& server) {
+    return [&] { return server.exchange(&request, sizeof request, sizeof(StatusReply)); };
+  };
+  const bool adds = comparePaired({.rounds = rounds, .unmeasured = 50, .measured = 1000},
+                                  {{"call of the daemon by the library", [&] { return library.call(); }},
+                                   {"the same without the library", callOf(daemon)},
+                                   {"bare ping-pong", callOf(bare)}},
+                                  {{0, 2, kMostOfLibrary, 1}});
+  const bool saves = comparePaired({.rounds = rounds, .unmeasured = 1, .measured = 5},
+                                   {{"1,000 calls in flight", [&] { return library.manyInFlight(); }},
+                                    {"1,000 calls one after another", [&] { return library.manyInTurn(); }}},
+                                   {{0, 1, kMostInFlight}});
+  return adds && saves;
+}
+
 bool compareManyClients(const std::string& daemonPath, int rounds) {
   rlimit descriptors{};
   require(::getrlimit(RLIMIT_NOFILE, &descriptors) == 0, "getrlimit");
@@ -398,9 +470,10 @@ int main(int argc, char** argv) {
   using namespace brenvik;
   const int rounds = argc > 1 ? std::atoi(argv[1]) : 25;
   const std::string_view only = argc > 2 ? argv[2] : "";
-  if (rounds < 1 ||
-      !(only.empty() || only == "calls" || only == "regions" || only == "starts" || only == "clients")) {
-    std::fprintf(stderr, "usage: TransportBenchmark [ROUNDS [calls | regions | starts | clients]]\n");
+  if (rounds < 1 || !(only.empty() || only == "calls" || only == "regions" || only == "starts" ||
+                      only == "clients" || only == "library")) {
+    std::fprintf(stderr,
+                 "usage: TransportBenchmark [ROUNDS [calls | regions | starts | clients | library]]\n");
     return 2;
   }
   pinToOneProcessor();
@@ -412,5 +485,6 @@ int main(int argc, char** argv) {
   const bool regions = !isWanted("regions") || compareRegions(bare, rounds);
   const bool starts = !isWanted("starts") || compareStarts(daemon, bare, rounds);
   const bool clients = !isWanted("clients") || compareManyClients(daemon, rounds);
-  return calls && regions && starts && clients ? 0 : 1;
+  const bool library = !isWanted("library") || compareLibrary(daemon, bare, rounds);
+  return calls && regions && starts && clients && library ? 0 : 1;
 }

@@ -51,6 +51,13 @@ int Deadline::millisecondsForPoll() const noexcept {
   return static_cast<int>(std::clamp<std::int64_t>(left, 0, INT_MAX));
 }
 
+timespec Deadline::forTimer() const noexcept {
+  if (end_ == Clock::time_point::max()) return {};
+  // steady_clock is CLOCK_MONOTONIC on Linux.
+  const auto time = std::chrono::duration_cast<std::chrono::nanoseconds>(end_.time_since_epoch()).count();
+  return {time / 1'000'000'000, time % 1'000'000'000};
+}
+
 Io waitFor(int descriptor, short events, Deadline deadline) noexcept {
   for (;;) {
     pollfd entry{descriptor, events, 0};
@@ -80,6 +87,7 @@ Io sendMessage(int socket, std::span<const iovec> parts, std::span<const int> de
     if (::sendmsg(socket, &message, MSG_DONTWAIT | MSG_NOSIGNAL) >= 0) return Io::done;
     if (errno == EINTR) continue;
     if (errno != EAGAIN) return ioOf(errno);
+    if (*next == Waiting::never) return Io::timedOut;
     *next = Waiting::byPoll;
     if (const Io waited = waitFor(socket, POLLOUT, deadline); waited != Io::done) return waited;
   }
@@ -88,9 +96,9 @@ Io sendMessage(int socket, std::span<const iovec> parts, std::span<const int> de
 Io receiveMessage(int socket, std::span<std::byte> buffer, Deadline deadline, Waiting waiting,
                   Incoming* incoming) noexcept {
   *incoming = Incoming{};
-  int flags = MSG_CMSG_CLOEXEC | (waiting == Waiting::byPoll ? MSG_DONTWAIT : 0);
+  int flags = MSG_CMSG_CLOEXEC | (waiting == Waiting::bySocketOption ? 0 : MSG_DONTWAIT);
   for (;;) {
-    if ((flags & MSG_DONTWAIT) != 0) {
+    if ((flags & MSG_DONTWAIT) != 0 && waiting != Waiting::never) {
       if (const Io waited = waitFor(socket, POLLIN, deadline); waited != Io::done) return waited;
     }
     // Room for the rights of a message and for credentials and a pidfd, should the peer have asked for them.
@@ -108,7 +116,8 @@ Io receiveMessage(int socket, std::span<std::byte> buffer, Deadline deadline, Wa
       // Whatever ended the first try early, a signal or a socket that does not block, poll does the rest.
       flags |= MSG_DONTWAIT;
       if (errno != EINTR && errno != EAGAIN) return ioOf(errno);
-      if (deadline.hasPassed()) return Io::timedOut;
+      if (waiting == Waiting::never && errno == EAGAIN) return Io::timedOut;
+      if (waiting != Waiting::never && deadline.hasPassed()) return Io::timedOut;
       continue;
     }
     incoming->length = static_cast<std::size_t>(length);

@@ -6,8 +6,10 @@
 
 #include <array>
 #include <chrono>
+#include <compare>
 #include <cstddef>
 #include <cstdint>
+#include <ctime>
 #include <span>
 
 #include "platform/base/UniqueFd.h"
@@ -19,10 +21,14 @@ class Deadline {
  public:
   static Deadline in(std::chrono::milliseconds time) noexcept { return Deadline(Clock::now() + time); }
   static Deadline never() noexcept { return Deadline(Clock::time_point::max()); }
+  static Deadline past() noexcept { return Deadline(Clock::time_point(std::chrono::nanoseconds(1))); }
 
   bool hasPassed() const noexcept { return end_ != Clock::time_point::max() && Clock::now() >= end_; }
   // What is left, as poll(2) takes it: rounded up, 0 when it has passed, -1 when there is none.
   int millisecondsForPoll() const noexcept;
+  // The time of CLOCK_MONOTONIC, as timerfd_settime(2) takes it; zero when there is none.
+  timespec forTimer() const noexcept;
+  auto operator<=>(const Deadline&) const noexcept = default;
 
  private:
   using Clock = std::chrono::steady_clock;
@@ -49,11 +55,11 @@ struct Incoming {
 };
 
 // How a wait is made: by poll, or by the socket's own SO_RCVTIMEO, which saves a system call and is only good
-// for one wait of that length.
-enum class Waiting : std::uint8_t { byPoll, bySocketOption };
+// for one wait of that length; or not at all, and then what would have waited has timed out.
+enum class Waiting : std::uint8_t { byPoll, bySocketOption, never };
 
 // Sends one datagram whole or not at all. `closed` and `reset`: nothing was delivered. When it had to wait
-// for room, *next becomes byPoll.
+// for room, *next becomes byPoll; when it is `never`, it does not wait.
 Io sendMessage(int socket, std::span<const iovec> parts, std::span<const int> descriptors, Deadline deadline,
                Waiting* next) noexcept;
 

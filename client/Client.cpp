@@ -2,8 +2,9 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "client/Client.h"
 
-#include <fcntl.h>
 #include <poll.h>
+#include <sched.h>
+#include <sys/eventfd.h>
 #include <sys/socket.h>
 
 #include <algorithm>
@@ -14,45 +15,11 @@
 namespace brenvik::client {
 namespace {
 
-// Check-in is tried again after 1, 2, 4 ... 512 ms: about a second, the time a helper needs many times over
-// to be started anew.
-constexpr int kMostTries = 11;
-
-constexpr std::size_t kMostRegions = 2;
-constexpr std::array<std::byte, 7> kPadding{};
+// How long a wait lasts that nobody can end early, because there was no descriptor to do it with.
+constexpr int kDeafWait = 20;  // milliseconds
 
 timeval timevalOf(std::chrono::milliseconds time) noexcept {
   return {time.count() / 1000, (time.count() % 1000) * 1000};
-}
-
-iovec iovecOf(std::span<const std::byte> bytes) noexcept {
-  return {const_cast<std::byte*>(bytes.data()), bytes.size()};  // for sending, which only reads
-}
-
-// connect(2) waits for room in a full backlog as long as SO_SNDTIMEO allows.
-Io connectTo(int socket, const sockaddr_un& address, Deadline deadline) noexcept {
-  for (;;) {
-    const timeval left = timevalOf(std::chrono::milliseconds(std::max(deadline.millisecondsForPoll(), 1)));
-    if (::setsockopt(socket, SOL_SOCKET, SO_SNDTIMEO, &left, sizeof left) != 0) return Io::failed;
-    if (::connect(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0) return Io::done;
-    if (errno != EINTR && errno != EAGAIN) return Io::failed;
-    if (deadline.hasPassed()) return Io::timedOut;
-  }
-}
-
-// What connect says when there is nobody, and no resource of ours is short.
-bool meansNobody(int error) noexcept {
-  switch (error) {
-    case EMFILE:
-    case ENFILE:
-    case ENOMEM:
-    case ENOBUFS:
-    case EBADF:
-    case EINVAL:
-      return false;
-    default:
-      return true;
-  }
 }
 
 }  // namespace
@@ -79,26 +46,49 @@ bool Client::setSocket(const char* path) noexcept {
 
 std::int32_t Client::connect() noexcept {
   systemError_ = 0;
+  if (takeInterruption()) return BVMH_ERROR_INTERRUPTED;
   if (channel_.isValid()) return BVMH_OK;
   const std::int32_t code = checkIn(Deadline::in(timeout_));
   wantsChannel_ = code == BVMH_OK;
+  rearm();
   return code;
 }
 
 void Client::disconnect() noexcept {
+  checkIn_.abandon();
+  finishAll(calls_.sent(), BVMH_ERROR_ANSWER_LOST, 0);
+  finishAll(calls_.waiting(), BVMH_ERROR_NOT_CONNECTED, 0);
   closeChannel();
   wantsChannel_ = false;
+  wasConnected_ = false;
+  rearm();
 }
 
-void Client::closeChannel() noexcept {
-  channel_.reset();
-  deathWatch_.reset();
+void Client::useChannel(CheckIn::Channel channel) noexcept {
+  channel_ = std::move(channel.socket);
+  deathWatch_ = std::move(channel.deathWatch);
+  ++channelSerial_;
+  channelNumber_ = channel_.get();
+  armedTimeout_ = std::chrono::milliseconds(0);
+  sentOnChannel_ = 0;
+  unanswered_ = 0;
+  sawReset_ = false;
 }
 
 PortName Client::nextReplyPort() noexcept {
   do ++lastReplyPort_;
   while (!isUsablePort(lastReplyPort_));
+  ++sentOnChannel_;
   return lastReplyPort_;
+}
+
+MessageHeader Client::headerOf(const RoutineFacts& routine, PortName replyPort) const noexcept {
+  return {(routine.descriptors == 0 ? 0 : kComplexBit) | kReplyDisposition,
+          routine.requestSize,
+          replyPort,
+          kNullPort,
+          0,
+          routine.id};
 }
 
 std::int32_t Client::codeOf(Exchange outcome) const noexcept {
@@ -115,84 +105,89 @@ std::int32_t Client::codeOf(Exchange outcome) const noexcept {
       return BVMH_ERROR_PROTOCOL;
     case Exchange::noMemory:
       return BVMH_ERROR_NO_MEMORY;
+    case Exchange::interrupted:
+      return BVMH_ERROR_INTERRUPTED;
     case Exchange::failed:
       break;
   }
   return BVMH_ERROR_SYSTEM;
 }
 
-std::int32_t Client::checkIn(Deadline deadline) noexcept {
-  bool hadLeft = false;
-  for (int tries = 1;; ++tries) {
-    UniqueFd channel;
-    const std::int32_t code = tryCheckIn(deadline, &channel);
-    if (code == BVMH_OK) {
-      channel_ = std::move(channel);
-      systemError_ = 0;
-      armedTimeout_ = std::chrono::milliseconds(0);
-      sentOnChannel_ = 0;
-      unanswered_ = 0;
-      return code;
-    }
-    deathWatch_.reset();
-    // A helper that stops closes what it has not answered; asking again may start it anew. Its socket may be
-    // missing for a moment then, which says nothing at the first try but that there is no helper.
-    const bool hasLeft = code == BVMH_ERROR_HELPER_GONE;
-    const bool isBetweenLives = hadLeft && code == BVMH_ERROR_UNREACHABLE;
-    if (!hasLeft && !isBetweenLives) return code;
-    hadLeft = true;
-    if (tries == kMostTries) return code;
-    const int left = deadline.millisecondsForPoll();
-    if (left == 0) return code;
-    ::poll(nullptr, 0, std::min(1 << (tries - 1), left));
+void Client::interrupt() noexcept {
+  if (interrupted_) return;  // whoever set it does the rest
+  const int error = errno;
+  ++interrupters_;  // keeps both descriptors from being closed
+  interrupted_ = true;
+  const int channel = channelNumber_;
+  if (waitsOnChannel_ && channel >= 0) {
+    wasCut_ = true;
+    ::shutdown(channel, SHUT_RDWR);
+  }
+  const int wake = wakeNumber_;
+  if (wake >= 0) {
+    const std::uint64_t one = 1;
+    // A full one is readable, too.
+    [[maybe_unused]] const ssize_t written = ::write(wake, &one, sizeof one);
+  }
+  --interrupters_;
+  errno = error;
+}
+
+bool Client::takeInterruption() noexcept {
+  if (!interrupted_.load(std::memory_order_relaxed)) return false;
+  while (interrupters_ != 0) ::sched_yield();
+  interrupted_ = false;
+  if (wasCut_) channelEnded();
+  return true;
+}
+
+void Client::closeChannel() noexcept {
+  if (!channel_.isValid()) return;
+  channelNumber_ = -1;
+  while (interrupters_ != 0) ::sched_yield();
+  wasCut_ = false;
+  rearm();  // Closing does not end the watch: the helper holds the same socket.
+  channel_.reset();
+  deathWatch_.reset();
+}
+
+void Client::waitForWork(Deadline deadline) noexcept {
+  if (!wake_.isValid()) {
+    wake_.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    wakeNumber_ = wake_.get();
+  }
+  std::array<pollfd, 2> entries{
+      pollfd{channel_.isValid() ? channel_.get() : checkIn_.descriptor(), POLLIN, 0},
+      pollfd{wake_.get(), POLLIN, 0}};
+  if (channel_.isValid() && !calls_.waiting().empty()) entries[0].events |= POLLOUT;
+  int time = std::min({deadline, earliest_, checkIn_.due()}).millisecondsForPoll();
+  if (!wake_.isValid() && (time < 0 || time > kDeafWait)) time = kDeafWait;
+  // Whoever interrupts from here on knows the descriptor.
+  if (interrupted_) return;
+  ::poll(entries.data(), entries.size(), time);  // whatever it says, whoever called us looks
+  if (entries[1].revents != 0) {
+    std::uint64_t count = 0;
+    [[maybe_unused]] const ssize_t taken = ::read(wake_.get(), &count, sizeof count);
   }
 }
 
-std::int32_t Client::tryCheckIn(Deadline deadline, UniqueFd* channel) noexcept {
-  const auto systemFailure = [this] {
-    systemError_ = errno;
-    return BVMH_ERROR_SYSTEM;
+std::int32_t Client::checkIn(Deadline deadline) noexcept {
+  const auto givenUp = [this](std::int32_t code) {
+    if (calls_.waiting().empty()) checkIn_.abandon();
+    return code;
   };
-  UniqueFd service(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-  if (!service.isValid()) return systemFailure();
-  switch (connectTo(service.get(), address_, deadline)) {
-    case Io::done:
-      break;
-    case Io::timedOut:
-      return BVMH_ERROR_TIMED_OUT;
-    default:
-      systemError_ = errno;
-      // The socket is the group's; who is not in it is refused before the helper could.
-      if (systemError_ == EACCES) return BVMH_INVALID_SECURITY;
-      return meansNobody(systemError_) ? BVMH_ERROR_UNREACHABLE : BVMH_ERROR_SYSTEM;
+  if (!checkIn_.isUnderWay()) checkIn_.start(address_);
+  for (;;) {
+    if (const auto code = checkIn_.advance()) {
+      systemError_ = checkIn_.systemError();
+      checkInEnded(*code);
+      return *code;
+    }
+    if (deadline.hasPassed()) return givenUp(BVMH_ERROR_TIMED_OUT);
+    if (takeInterruption()) return givenUp(BVMH_ERROR_INTERRUPTED);
+    expire();
+    waitForWork(deadline);
   }
-
-  int ends[2];
-  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0) return systemFailure();
-  deathWatch_.reset(ends[0]);
-  const UniqueFd given(ends[1]);
-
-  CheckInRequest request{};
-  request.header = {
-      kComplexBit | kReplyDisposition, sizeof request, nextReplyPort(), 0, 0, kCheckInRoutine.id};
-  request.descriptorCount = 1;
-  request.clientPort.disposition = kDispositionMoveSend;
-  request.clientPort.type = kPortDescriptorType;
-  const std::array parts{iovecOf(std::as_bytes(std::span(&request, 1)))};
-  const std::array descriptors{given.get()};
-  Reply reply;
-  const Exchange outcome = exchange(service.get(), kCheckInRoutine, parts, descriptors,
-                                    request.header.replyPort, deadline, Waiting::byPoll, &reply);
-  // Asking twice does no harm, so a helper that read the question and left counts like one that did not.
-  if (outcome == Exchange::lost) return BVMH_ERROR_HELPER_GONE;
-  if (outcome != Exchange::answered) return codeOf(outcome);
-  if (reply.code != BVMH_OK) return reply.code;
-
-  // The helper may have made the pair for its own use, not blocking; waiting in recvmsg saves us a poll.
-  const int flags = ::fcntl(reply.port.get(), F_GETFL);
-  if (flags >= 0 && (flags & O_NONBLOCK) != 0) (void)::fcntl(reply.port.get(), F_SETFL, flags & ~O_NONBLOCK);
-  *channel = std::move(reply.port);
-  return BVMH_OK;
 }
 
 Waiting Client::armSocketTimeout() noexcept {
@@ -203,70 +198,56 @@ Waiting Client::armSocketTimeout() noexcept {
   return Waiting::bySocketOption;
 }
 
-std::int32_t Client::call(const RoutineFacts& routine, std::span<std::byte> message,
-                          std::span<const std::span<const std::byte>> regions, Reply* reply) noexcept {
+std::int32_t Client::call(const RoutineFacts& routine, std::span<std::byte> message, Regions regions,
+                          bvmh_result* result) noexcept {
   systemError_ = 0;
+  result->region = bvmh_region{};
   if (!wantsChannel_) return BVMH_ERROR_NOT_CONNECTED;
+  if (takeInterruption()) return BVMH_ERROR_INTERRUPTED;
+  if (!calls_.areFinished() || checkIn_.isUnderWay())
+    return callAmongBegun(routine, message, regions, result);
   const Deadline deadline = Deadline::in(timeout_);
 
-  // Regions follow the message in the datagram while they fit, each at a multiple of 8; the rest are memfds.
-  std::array<iovec, 1 + 2 * kMostRegions> parts;
-  std::size_t partCount = 0;
-  parts[partCount++] = iovecOf(message);
-  std::array<UniqueFd, kMostRegions> memories;
-  std::array<int, kMostRegions> descriptors{};
-  std::size_t descriptorCount = 0;
-  std::size_t end = message.size();
-  for (std::size_t i = 0; i < regions.size(); ++i) {
-    OutOfLineDescriptor descriptor{};
-    descriptor.type = kOutOfLineDescriptorType;
-    descriptor.copy = kVirtualCopy;
-    descriptor.size = static_cast<std::uint32_t>(regions[i].size());
-    const std::size_t offset = roundUpTo8(end);
-    if (regions[i].size() > kLargestDatagram - offset) {
-      memories[i] = makeSealedMemory(regions[i]);
-      if (!memories[i].isValid()) {
-        systemError_ = errno;
-        return BVMH_ERROR_SYSTEM;
-      }
-      descriptors[descriptorCount++] = memories[i].get();
-    } else if (!regions[i].empty()) {
-      descriptor.address = offset;
-      if (offset != end) parts[partCount++] = iovecOf(std::span(kPadding).first(offset - end));
-      parts[partCount++] = iovecOf(regions[i]);
-      end = offset + regions[i].size();
-    }
-    std::memcpy(message.data() + kDescriptorsOffset + i * sizeof descriptor, &descriptor, sizeof descriptor);
+  Outgoing request;
+  if (!request.lay(message, regions)) {
+    systemError_ = errno;
+    return BVMH_ERROR_SYSTEM;
   }
-
   for (bool hasCheckedIn = false;;) {
     if (!channel_.isValid()) {
       if (hasCheckedIn) return BVMH_ERROR_HELPER_GONE;
       if (const std::int32_t code = checkIn(deadline); code != BVMH_OK) return code;
+      rearm();
       hasCheckedIn = true;
     }
     // A check-in has used up some of the time, which the socket option does not know.
     const Waiting waiting = hasCheckedIn ? Waiting::byPoll : armSocketTimeout();
-    const MessageHeader header{(regions.empty() ? 0 : kComplexBit) | kReplyDisposition,
-                               static_cast<std::uint32_t>(message.size()),
-                               nextReplyPort(),
-                               kNullPort,
-                               0,
-                               routine.id};
+    const PortName replyPort = nextReplyPort();
+    const MessageHeader header = headerOf(routine, replyPort);
     std::memcpy(message.data(), &header, sizeof header);
-    ++sentOnChannel_;
-    const Exchange outcome =
-        exchange(channel_.get(), routine, std::span(parts).first(partCount),
-                 std::span(descriptors).first(descriptorCount), header.replyPort, deadline, waiting, reply);
+    Reply reply;
+    waitsOnChannel_ = true;
+    Exchange outcome = interrupted_ ? Exchange::interrupted
+                                    : exchange(routine, request, replyPort, deadline, waiting, &reply);
+    waitsOnChannel_.store(false, std::memory_order_release);
+    if (outcome != Exchange::answered && interrupted_) outcome = Exchange::interrupted;
     switch (outcome) {
-      case Exchange::answered:
-        return reply->code;
+      case Exchange::answered: {
+        const std::int32_t code = reply.code == BVMH_OK ? readResult(routine, reply, result) : reply.code;
+        incoming_ = Incoming{};
+        if (code == BVMH_ERROR_PROTOCOL) closeChannel();
+        if (code == BVMH_OK) questions_.asked(routine.id, 0, std::chrono::steady_clock::now());
+        return code;
+      }
       case Exchange::notTaken:
         closeChannel();
         continue;
       case Exchange::lost:
       case Exchange::broken:
         closeChannel();
+        break;
+      case Exchange::interrupted:
+        (void)takeInterruption();
         break;
       case Exchange::timedOut:
       case Exchange::failed:
@@ -277,11 +258,31 @@ std::int32_t Client::call(const RoutineFacts& routine, std::span<std::byte> mess
   }
 }
 
-Client::Exchange Client::exchange(int socket, const RoutineFacts& routine, std::span<const iovec> parts,
-                                  std::span<const int> descriptors, PortName replyPort, Deadline deadline,
-                                  Waiting waiting, Reply* reply) noexcept {
+std::int32_t Client::callAmongBegun(const RoutineFacts& routine, std::span<const std::byte> message,
+                                    Regions regions, bvmh_result* result) noexcept {
+  BegunCall* const call = add(routine, message, regions, nullptr);
+  if (call == nullptr) return BVMH_ERROR_NO_MEMORY;
+  call->isBlocking = true;
+  const bvmh_call number = call->result.call;
+  for (;;) {
+    settle();
+    if (call->state == BegunCall::State::finished) {
+      (void)takeResult(number, result);
+      systemError_ = result->system_error;
+      return result->code;
+    }
+    if (takeInterruption()) {
+      (void)cancel(number);
+      return BVMH_ERROR_INTERRUPTED;
+    }
+    waitForWork(Deadline::never());
+  }
+}
+
+Client::Exchange Client::exchange(const RoutineFacts& routine, const Outgoing& request, PortName replyPort,
+                                  Deadline deadline, Waiting waiting, Reply* reply) noexcept {
   if (!buffer_.ensure()) return Exchange::noMemory;
-  switch (sendMessage(socket, parts, descriptors, deadline, &waiting)) {
+  switch (sendMessage(channel_.get(), request.parts(), request.descriptors(), deadline, &waiting)) {
     case Io::done:
       break;
     case Io::closed:
@@ -293,16 +294,16 @@ Client::Exchange Client::exchange(int socket, const RoutineFacts& routine, std::
       systemError_ = errno;
       return Exchange::failed;
   }
-  const Exchange outcome = awaitReply(socket, routine, replyPort, deadline, waiting, reply);
+  const Exchange outcome = awaitReply(routine, replyPort, deadline, waiting, reply);
   if (outcome != Exchange::answered) incoming_ = Incoming{};
   if (outcome == Exchange::timedOut || outcome == Exchange::failed) ++unanswered_;
   return outcome;
 }
 
-Client::Exchange Client::awaitReply(int socket, const RoutineFacts& routine, PortName replyPort,
-                                    Deadline deadline, Waiting waiting, Reply* reply) noexcept {
+Client::Exchange Client::awaitReply(const RoutineFacts& routine, PortName replyPort, Deadline deadline,
+                                    Waiting waiting, Reply* reply) noexcept {
   for (;;) {
-    switch (receiveMessage(socket, buffer_.bytes(), deadline, waiting, &incoming_)) {
+    switch (receiveMessage(channel_.get(), buffer_.bytes(), deadline, waiting, &incoming_)) {
       case Io::done:
         break;
       case Io::closed:
@@ -337,11 +338,33 @@ bool Client::isLateAnswer(PortName answered, PortName replyPort) noexcept {
   return true;
 }
 
-std::int32_t Client::takeRegion(const Reply& reply, bvmh_region* region) noexcept {
-  const std::int32_t code = client::takeRegion(reply.region, buffer_, incoming_, region);
-  incoming_ = Incoming{};
-  if (code == BVMH_ERROR_PROTOCOL) closeChannel();
-  return code;
+std::int32_t Client::readResult(const RoutineFacts& routine, const Reply& reply,
+                                bvmh_result* result) noexcept {
+  const auto* const fields = reinterpret_cast<const char*>(reply.datagram.data()) + sizeof(StatusReply);
+  const auto readText = [&](std::size_t fieldSize) {
+    static_assert(sizeof result->text > sizeof(String256Reply::text));
+    const std::size_t length = ::strnlen(fields, fieldSize);
+    std::memcpy(result->text, fields, length);
+    result->text[length] = '\0';
+  };
+  switch (routine.reply) {
+    case ReplyForm::integer:
+      // Only the first byte of the field means anything.
+      result->boolean = fields[0] != 0;
+      break;
+    case ReplyForm::string64:
+      readText(sizeof(String64Reply::text));
+      break;
+    case ReplyForm::string256:
+      readText(sizeof(String256Reply::text));
+      break;
+    case ReplyForm::outOfLine:
+      return takeRegion(reply.region, buffer_, incoming_, &result->region);
+    case ReplyForm::status:
+    case ReplyForm::checkIn:
+      break;
+  }
+  return BVMH_OK;
 }
 
 }  // namespace brenvik::client

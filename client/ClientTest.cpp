@@ -429,7 +429,7 @@ TEST(ClientTest, OutValuesAreOnlyWrittenOnSuccess) {
   ASSERT_EQ(bvmh_connect(client.get()), BVMH_OK);
   char text[BVMH_TOKEN_SIZE] = "as it was";
   bool flag = true;
-  bvmh_region region{text, 3, nullptr};
+  bvmh_region region{text, 3, nullptr, nullptr};
   EXPECT_EQ(BVMobileHelperCopyVoicemailToken(client.get(), text, sizeof text), 5);
   EXPECT_STREQ(text, "as it was");
   EXPECT_EQ(BVMobileHelperCopyCrashLogs(client.get(), "/x", &flag), 5);

@@ -52,6 +52,22 @@ extern "C" const char* bvmh_error_text(int32_t code) {
       return "the service manager handed over no such socket";
     case BVMH_ERROR_NO_LONGER_THERE:
       return "the sender no longer waits for an answer";
+    case BVMH_ERROR_INTERRUPTED:
+      return "the call was interrupted";
+    case BVMH_ERROR_TOO_MANY_CALLS:
+      return "too many calls have been begun and their results not taken";
+    case BVMH_ERROR_IN_PROGRESS:
+      return "the call has no result yet";
+    case BVMH_ERROR_NO_SUCH_CALL:
+      return "no such call";
+    case BVMH_ERROR_NOT_A_VALUE:
+      return "not a property list, or one beyond a limit";
+    case BVMH_ERROR_AMBIGUOUS:
+      return "the push could answer more than one question";
+    case BVMH_ERROR_NAME_LOST:
+      return "the service's socket file is gone";
+    case BVMH_ERROR_NOT_ASKED:
+      return "the push answers no question of this client";
     default:
       return code >= BVMH_ERROR_FIRST && code <= BVMH_ERROR_LAST
                  ? "unknown transport failure"

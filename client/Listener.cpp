@@ -4,6 +4,7 @@
 
 #include <fcntl.h>
 #include <sys/epoll.h>
+#include <sys/inotify.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -29,6 +30,7 @@ constexpr int kMostOvertime = 64;
 
 // Events of the services carry 0 and 1, those of a connection its index and this.
 constexpr std::uint64_t kFirstConnectionKey = 2;
+constexpr std::uint64_t kNamesKey = UINT64_MAX;
 
 template <class Message>
 Message readAs(std::span<const std::byte> datagram) noexcept {
@@ -85,11 +87,13 @@ bool ServiceSocket::adopt(int descriptor) noexcept {
 }
 
 ServiceSocket::~ServiceSocket() {
-  if (!socket_.isValid() || address_.sun_path[0] == '\0') return;
+  if (socket_.isValid() && isNamed()) ::unlink(address_.sun_path);
+}
+
+bool ServiceSocket::isNamed() const noexcept {
   struct stat facts {};
-  if (::lstat(address_.sun_path, &facts) == 0 && facts.st_dev == device_ && facts.st_ino == inode_) {
-    ::unlink(address_.sun_path);
-  }
+  return address_.sun_path[0] != '\0' && ::lstat(address_.sun_path, &facts) == 0 && facts.st_dev == device_ &&
+         facts.st_ino == inode_;
 }
 
 std::int32_t ServiceSocket::listenAt(const char* directory, const char* name) noexcept {
@@ -184,7 +188,38 @@ std::int32_t Listener::open(const char* directory, unsigned services) noexcept {
     if (code != BVMH_OK) return code;
     if (const std::int32_t watched = watch(each.service); watched != BVMH_OK) return watched;
   }
+  watchNames();
   return BVMH_OK;
+}
+
+// Without it, a name that is lost is not noticed, and all else works.
+void Listener::watchNames() noexcept {
+  names_.reset(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+  if (!names_.isValid()) return;
+  for (const ServiceSocket& each : services_) {
+    // A file that is removed while somebody has it open changes its attributes, its number of links.
+    if (each.path()[0] != '\0')
+      ::inotify_add_watch(names_.get(), each.path(),
+                          IN_ATTRIB | IN_MOVE_SELF | IN_DELETE_SELF | IN_DONT_FOLLOW);
+  }
+  epoll_event event{};
+  event.events = EPOLLIN;
+  event.data.u64 = kNamesKey;
+  if (::epoll_ctl(poll_.get(), EPOLL_CTL_ADD, names_.get(), &event) != 0) names_.reset();
+}
+
+bool Listener::hasLostName() noexcept {
+  alignas(inotify_event) std::array<char, 1024> events;
+  // Only that something happened counts; the file itself is looked at.
+  while (::read(names_.get(), events.data(), events.size()) > 0) {
+  }
+  bool isNew = false;
+  for (std::size_t i = 0; i < services_.size(); ++i) {
+    const bool isLost = services_[i].path()[0] != '\0' && !services_[i].isNamed();
+    isNew = isNew || (isLost && !hasLostName_[i]);
+    hasLostName_[i] = isLost;
+  }
+  return isNew;
 }
 
 std::int32_t Listener::accept(Service service) noexcept {
@@ -230,6 +265,10 @@ std::int32_t Listener::next(Deadline deadline, bvmh_event* event) noexcept {
       continue;
     }
     std::int32_t code = BVMH_OK;
+    if (ready.data.u64 == kNamesKey) {
+      if (hasLostName()) return BVMH_ERROR_NAME_LOST;
+      continue;
+    }
     if (ready.data.u64 < kFirstConnectionKey) {
       code = accept(static_cast<Service>(ready.data.u64));
       if (code != BVMH_OK) return code;

@@ -32,6 +32,10 @@ class ServiceSocket {
   // Gives an adopted descriptor back to whoever gave it.
   void giveBack() noexcept { (void)socket_.release(); }
   int get() const noexcept { return socket_.get(); }
+  // The file that it made; empty when it made none.
+  const char* path() const noexcept { return address_.sun_path; }
+  // Whether that file is still there.
+  bool isNamed() const noexcept;
 
  private:
   UniqueFd socket_;
@@ -68,6 +72,9 @@ class Listener {
   std::int32_t systemFailure() noexcept;
   std::int32_t prepare() noexcept;
   std::int32_t watch(Service service) noexcept;
+  void watchNames() noexcept;
+  // Whether a service has lost its file since it was last asked.
+  bool hasLostName() noexcept;
   std::int32_t accept(Service service) noexcept;
   // Reads one message; true when it was one for the caller.
   bool read(Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;
@@ -76,7 +83,9 @@ class Listener {
   void refuse(const Connection& connection, const MessageHeader& request, KernelReturn code) noexcept;
 
   UniqueFd poll_;
+  UniqueFd names_;  // an inotify of the files that services_ made, if the system has one left
   std::array<ServiceSocket, 2> services_;
+  std::array<bool, 2> hasLostName_{};
   std::array<Connection, kMostConnections> connections_;
   std::uint64_t lastSerial_ = 0;
   uid_t allowedUid_ = 0;  // beside the superuser and our own

@@ -330,6 +330,42 @@ TEST_F(ListenerTest, AFolderThatCannotBeMadeIsTold) {
   EXPECT_EQ(none, nullptr);
 }
 
+TEST_F(ListenerTest, AFolderThatVanishedIsToldOnceAndWhoIsConnectedIsStillServed) {
+  listen();
+  const UniqueFd helper = connect(kPushes);
+  EXPECT_EQ(bvmh_listener_next(listener_.get(), 0, &event_), BVMH_ERROR_TIMED_OUT);
+  ASSERT_EQ(::unlink((directory_.path() + kPushes).c_str()), 0);
+  ASSERT_EQ(::unlink((directory_.path() + kNotifications).c_str()), 0);
+  ASSERT_EQ(::rmdir(directory_.path().c_str()), 0);
+  pollfd ready{bvmh_listener_fd(listener_.get()), POLLIN, 0};
+  EXPECT_EQ(::poll(&ready, 1, kPlenty), 1);
+  EXPECT_EQ(bvmh_listener_next(listener_.get(), kPlenty, &event_), BVMH_ERROR_NAME_LOST);
+  EXPECT_EQ(event_.kind, BVMH_EVENT_NONE);
+  EXPECT_EQ(bvmh_listener_next(listener_.get(), 0, &event_), BVMH_ERROR_TIMED_OUT);
+  send(helper, push(9100002, 77, kAddressList));
+  EXPECT_EQ(next(BVMH_EVENT_LOCAL_ADDRESS), kAddressList);
+  // Another one can be made in its place.
+  listener_.reset();
+  listen();
+  EXPECT_TRUE(connect(kPushes).isValid());
+}
+
+TEST_F(ListenerTest, OfTwoServicesEachTellsThatItsNameWasMoved) {
+  listen();
+  for (const char* each : {kPushes, kNotifications}) {
+    const std::string path = directory_.path() + each;
+    ASSERT_EQ(::rename(path.c_str(), (path + ".old").c_str()), 0);
+    EXPECT_EQ(bvmh_listener_next(listener_.get(), kPlenty, &event_), BVMH_ERROR_NAME_LOST);
+    EXPECT_EQ(bvmh_listener_next(listener_.get(), 0, &event_), BVMH_ERROR_TIMED_OUT);
+  }
+}
+
+TEST_F(ListenerTest, AChangedModeIsNoLostName) {
+  listen();
+  ASSERT_EQ(::chmod((directory_.path() + kPushes).c_str(), 0600), 0);
+  EXPECT_EQ(bvmh_listener_next(listener_.get(), 0, &event_), BVMH_ERROR_TIMED_OUT);
+}
+
 TEST_F(ListenerTest, ALiveNameIsLeftAloneAndAStaleOneReplaced) {
   listen();
   bvmh_listener* second = nullptr;

@@ -76,13 +76,13 @@ std::int32_t takeRegion(const RegionPlace& place, Buffer& buffer, const Incoming
   if (place.offset != 0) {
     const std::byte* bytes = buffer.bytes().data() + place.offset;
     if (place.size >= kWorthTheBuffer) {
-      *region = {bytes, place.size, buffer.release()};
+      *region = {bytes, place.size, buffer.release(), nullptr};
       return BVMH_OK;
     }
     void* copy = std::malloc(place.size);
     if (copy == nullptr) return BVMH_ERROR_NO_MEMORY;
     std::memcpy(copy, bytes, place.size);
-    *region = {copy, place.size, copy};
+    *region = {copy, place.size, copy, nullptr};
     return BVMH_OK;
   }
   const int memory = incoming.descriptors[0].get();
@@ -94,7 +94,7 @@ std::int32_t takeRegion(const RegionPlace& place, Buffer& buffer, const Incoming
     return BVMH_ERROR_PROTOCOL;
   void* mapping = ::mmap(nullptr, place.size, PROT_READ, MAP_PRIVATE, memory, 0);
   if (mapping == MAP_FAILED) return errno == ENOMEM ? BVMH_ERROR_NO_MEMORY : BVMH_ERROR_PROTOCOL;
-  *region = {mapping, place.size, &mappingMark};
+  *region = {mapping, place.size, &mappingMark, nullptr};
   return BVMH_OK;
 }
 

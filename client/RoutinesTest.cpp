@@ -2,8 +2,10 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <gtest/gtest-spi.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 
 #include <functional>
+#include <map>
 #include <memory>
 #include <set>
 #include <string>
@@ -218,7 +220,106 @@ const std::vector<RoutineCase>& cases() {
   return all;
 }
 
+// The same calls, begun.
+using Begin = std::int32_t (*)(bvmh_client*, bvmh_call*);
+const std::map<std::string, Begin>& begins() {
+  static const std::map<std::string, Begin> all{
+      {"BVMobileHelperSetVoicemailToken",
+       [](auto* c, auto* n) { return BVMobileHelperSetVoicemailTokenBegin(c, "tok\xC3\xA9n", nullptr, n); }},
+      {"BVMobileHelperSetVoicemailTokenForKey",
+       [](auto* c, auto* n) {
+         return BVMobileHelperSetVoicemailTokenForKeyBegin(c, "key", "token", nullptr, n);
+       }},
+      {"BVMobileHelperClearVoicemailToken",
+       [](auto* c, auto* n) { return BVMobileHelperClearVoicemailTokenBegin(c, nullptr, n); }},
+      {"BVMobileHelperResetVoicemailStore",
+       [](auto* c, auto* n) { return BVMobileHelperResetVoicemailStoreBegin(c, nullptr, n); }},
+      {"BVMobileHelperCopyVoicemailTokenForKey",
+       [](auto* c, auto* n) { return BVMobileHelperCopyVoicemailTokenForKeyBegin(c, "key", nullptr, n); }},
+      {"BVMobileHelperCopyVoicemailToken",
+       [](auto* c, auto* n) { return BVMobileHelperCopyVoicemailTokenBegin(c, nullptr, n); }},
+      {"BVMobileHelperSetPreferenceValue",
+       [](auto* c, auto* n) {
+         return BVMobileHelperSetPreferenceValueBegin(c, "com.norvale.carrier", "Key", "<plist>", 7, nullptr,
+                                                      n);
+       }},
+      {"BVMobileHelperCopyPreferenceValue",
+       [](auto* c, auto* n) {
+         return BVMobileHelperCopyPreferenceValueBegin(c, "domain", "key", nullptr, n);
+       }},
+      {"BVMobileHelperCopyAppPreferenceValue",
+       [](auto* c, auto* n) {
+         return BVMobileHelperCopyAppPreferenceValueBegin(c, "domain", "key", nullptr, n);
+       }},
+      {"BVMobileHelperReplaceCarrierSymlink",
+       [](auto* c, auto* n) {
+         return BVMobileHelperReplaceCarrierSymlinkBegin(c, "/target", "/link", "domain", nullptr, n);
+       }},
+      {"BVMobileHelperCreateSymlink",
+       [](auto* c, auto* n) { return BVMobileHelperCreateSymlinkBegin(c, "/target", "/link", nullptr, n); }},
+      {"BVMobileHelperRemoveCarrierFile",
+       [](auto* c, auto* n) {
+         return BVMobileHelperRemoveCarrierFileBegin(c, "/file", "domain", nullptr, n);
+       }},
+      {"BVMobileHelperIsVoicemailServiceSubscribed",
+       [](auto* c, auto* n) { return BVMobileHelperIsVoicemailServiceSubscribedBegin(c, nullptr, n); }},
+      {"BVMobileHelperCellularHeartbeat",
+       [](auto* c, auto* n) { return BVMobileHelperCellularHeartbeatBegin(c, -2, nullptr, n); }},
+      {"BVMobileHelperCheckLASDUpdate",
+       [](auto* c, auto* n) { return BVMobileHelperCheckLASDUpdateBegin(c, 31, nullptr, n); }},
+      {"BVMobileHelperCopyCarrierFile",
+       [](auto* c, auto* n) {
+         return BVMobileHelperCopyCarrierFileBegin(c, "/from", "/to", "name", nullptr, n);
+       }},
+      {"BVMobileHelperCopyCrashLogs",
+       [](auto* c, auto* n) { return BVMobileHelperCopyCrashLogsBegin(c, "/logs", nullptr, n); }},
+      {"BVMobileHelperMoveIntoCarrierBundles",
+       [](auto* c, auto* n) {
+         return BVMobileHelperMoveIntoCarrierBundlesBegin(c, "/source", "/destination", "name", nullptr, n);
+       }},
+      {"BVMobileHelperRequestCountryCodeFromLocation",
+       [](auto* c, auto* n) {
+         return BVMobileHelperRequestCountryCodeFromLocationBegin(c, 52.5, -13.25, nullptr, n);
+       }},
+      {"BVMobileHelperCopyCountryCode",
+       [](auto* c, auto* n) { return BVMobileHelperCopyCountryCodeBegin(c, nullptr, n); }},
+      {"BVMobileHelperRequestWanIPFromLocation",
+       [](auto* c, auto* n) { return BVMobileHelperRequestWanIPFromLocationBegin(c, nullptr, n); }},
+      {"BVMobileHelperEnableRadioManagerLogs",
+       [](auto* c, auto* n) { return BVMobileHelperEnableRadioManagerLogsBegin(c, 2, nullptr, n); }},
+      {"BVMobileHelperUnpackArchive",
+       [](auto* c, auto* n) { return BVMobileHelperUnpackArchiveBegin(c, "/a.zip", "/to", nullptr, n); }},
+      {"BVMobileHelperLoadPlistFile",
+       [](auto* c, auto* n) { return BVMobileHelperLoadPlistFileBegin(c, "/a.plist", nullptr, n); }},
+      {"BVMobileHelperCopyBadgeLabels",
+       [](auto* c, auto* n) {
+         return BVMobileHelperCopyBadgeLabelsBegin(c, "[label]", 7, "[de]", 4, nullptr, n);
+       }},
+      {"BVMobileHelperCopyLocalizedLabels",
+       [](auto* c, auto* n) {
+         return BVMobileHelperCopyLocalizedLabelsBegin(c, "[eightby]", 9, "[]", 2, nullptr, n);
+       }},
+      {"BVMobileHelperRemapContactsChannel", [](auto* c, auto* n) {
+         return BVMobileHelperRemapContactsChannelBegin(c, "from", "to", nullptr, n);
+       }}};
+  return all;
+}
+
 class RoutineTest : public testing::TestWithParam<RoutineCase> {};
+
+void expectBytes(const RoutineCase& routine, const Message& seen) {
+  ASSERT_GE(seen.bytes.size(), 24U);
+  EXPECT_NE(seen.replyPort(), 0U);
+  EXPECT_TRUE(seen.descriptors.empty());
+  const bool isComplex = routine.id == 8683555 || routine.id == 8683573 || routine.id == 8683574;
+  const std::size_t messageSize = routine.id == 8683555 ? 568 : isComplex ? 76 : routine.body.size();
+  Bytes wanted = routine.body;
+  wanted.u32(0, isComplex ? 0x80000012 : 18)
+      .u32(4, static_cast<std::uint32_t>(messageSize))
+      .u32(8, seen.replyPort())
+      .i32(20, routine.id);
+  EXPECT_EQ(testing::PrintToString(seen.bytes.string()), testing::PrintToString(wanted.string()));
+}
 
 TEST_P(RoutineTest, SendsExactlyItsBytesAndReadsItsReply) {
   const RoutineCase& routine = GetParam();
@@ -233,17 +334,47 @@ TEST_P(RoutineTest, SendsExactlyItsBytesAndReadsItsReply) {
     const ClientPointer client = connectedTo(helper);
     EXPECT_EQ(routine.call(client.get()), BVMH_OK);
   }
-  ASSERT_GE(seen.bytes.size(), 24U);
-  EXPECT_NE(seen.replyPort(), 0U);
-  EXPECT_TRUE(seen.descriptors.empty());
-  const bool isComplex = routine.id == 8683555 || routine.id == 8683573 || routine.id == 8683574;
-  const std::size_t messageSize = routine.id == 8683555 ? 568 : isComplex ? 76 : routine.body.size();
-  Bytes wanted = routine.body;
-  wanted.u32(0, isComplex ? 0x80000012 : 18)
-      .u32(4, static_cast<std::uint32_t>(messageSize))
-      .u32(8, seen.replyPort())
-      .i32(20, routine.id);
-  EXPECT_EQ(testing::PrintToString(seen.bytes.string()), testing::PrintToString(wanted.string()));
+  expectBytes(routine, seen);
+}
+
+// The result holds what the blocking call gives out.
+void expectSame(const bvmh_result& result, const Bytes& reply) {
+  const std::string rest = reply.string().substr(36);
+  if (result.message_id == 8683553 || result.message_id == 8683554 || result.message_id == 8683568) {
+    EXPECT_STREQ(result.text, rest.c_str());
+  } else if ((reply.u32At(0) & 0x80000000) != 0) {
+    EXPECT_EQ(asText(result.region), reply.string().substr(56));
+  } else {
+    EXPECT_EQ(result.boolean, !rest.empty() && rest[0] != 0);
+  }
+}
+
+TEST_P(RoutineTest, BegunItSendsTheSameBytesAndItsResultIsTheSame) {
+  const RoutineCase& routine = GetParam();
+  Message seen;
+  Bytes reply;
+  {
+    ScriptedHelper helper([&](Script& script) {
+      const UniqueFd channel = script.checkIn();
+      seen = script.receive(channel);
+      reply = routine.answer(seen);
+      script.send(channel, reply);
+      script.expectEnd(channel);
+    });
+    const ClientPointer client = connectedTo(helper);
+    bvmh_call call = 0;
+    ASSERT_EQ(begins().at(routine.name)(client.get(), &call), BVMH_OK);
+    pollfd ready{bvmh_client_fd(client.get()), POLLIN, 0};
+    ASSERT_EQ(::poll(&ready, 1, 60'000), 1);
+    bvmh_process(client.get());
+    bvmh_result result{};
+    ASSERT_EQ(bvmh_take_result(client.get(), call, &result), BVMH_OK);
+    EXPECT_EQ(result.code, BVMH_OK);
+    EXPECT_EQ(result.message_id, routine.id);
+    expectSame(result, reply);
+    bvmh_result_free(&result);
+  }
+  expectBytes(routine, seen);
 }
 
 TEST_P(RoutineTest, ReturnsTheHelpersRefusal) {

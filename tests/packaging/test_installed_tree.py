@@ -61,7 +61,14 @@ class InstalledTree(unittest.TestCase):
                         r"lib.*/brenvik/brenvik-web\.so", r"bin/bvhelperctl", r"bin/brenvik-standin",
                         r"lib.*/libbrenvik-mobile-helper\.a",
                         r"lib.*/libbrenvik-mobile-helper\.so", r"lib.*/libbrenvik-mobile-helper\.so\.0",
-                        r"include/brenvik/mobile_helper\.h", r"lib.*/pkgconfig/brenvik-mobile-helper\.pc",
+                        r"include/brenvik/mobile_helper\.h",
+                        r"include/brenvik/mobile_helper\.hpp", r"share/brenvik-mobile-helper/protocol\.json",
+                        r"share/brenvik-mobile-helper/protocol\.schema\.json", r"bin/brenvik-mobile-helper-mock",
+                        r"lib/python3/dist-packages/brenvik_mobile_helper/py\.typed",
+                        r"share/bash-completion/completions/brenvik-mobile-helper-mock",
+                        r"share/zsh/vendor-completions/_brenvik-mobile-helper-mock",
+                        r"share/fish/vendor_completions\.d/brenvik-mobile-helper-mock\.fish",
+                        r"lib.*/pkgconfig/brenvik-mobile-helper\.pc",
                         r"lib.*/cmake/BrenvikMobileHelper/BrenvikMobileHelperConfig\.cmake",
                         r"lib/systemd/system/brenvik-mobile-helper\.socket",
                         r"lib/systemd/system/brenvik-mobile-helper\.service",
@@ -76,6 +83,16 @@ class InstalledTree(unittest.TestCase):
             self.one(pattern)
         self.assertTrue((self.root / "etc/brenvik/entitlements.d").is_dir())
         self.assertTrue((self.root / "usr/lib/brenvik/entitlements.d").is_dir())
+
+    def test_the_installed_python_package_and_mock_work_from_where_they_stand(self):
+        mock = self.one(r"bin/brenvik-mobile-helper-mock")
+        self.assertRegex(run(mock, "--version"), r"^brenvik-mobile-helper-mock \d")
+        code = "import brenvik_mobile_helper as package; print(package.service_socket())"
+        folder = self.one(r"lib/python3/dist-packages/brenvik_mobile_helper/__init__\.py").parent.parent
+        printed = run(sys.executable, "-c", code, env={**os.environ, "PYTHONPATH": str(folder), "PYTHONDONTWRITEBYTECODE": "1"})
+        place = re.search(r"^BRENVIK_BOOTSTRAP_DIRECTORY:\w+=(.*)$", self.cache, flags=re.M)[1]
+        self.assertEqual(printed, f"{place}/com.norvale.brenvik.mobile-helper\n")
+        self.assertEqual(list(folder.rglob("*.pyc")), [])
 
     def test_places_that_are_compiled_in_are_there_whatever_the_prefix(self):
         for name in ("BRENVIK_GAZETTEER", "BRENVIK_ENTITLEMENT_DIRECTORIES"):

@@ -1,24 +1,35 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 //
-// Prints the table of routines for docs/protocol.md from the message structs, so that the page cannot say
-// anything else than the code. A test compares the two.
+// Prints the protocol from the message structs, so that no page and no other language says anything else than
+// the code: the table of routines for docs/protocol.md, or everything as JSON. Tests compare.
+//
+// usage: protocol-table [json]
+#include <brenvik/mobile_helper.h>
+
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
+#include <nlohmann/json.hpp>
 #include <string>
 #include <vector>
 
 #include "interface/Routines.h"
+#include "interface/TelephonyMessages.h"
 
 namespace {
 
 using namespace brenvik;
+using nlohmann::ordered_json;
 
 struct Argument {
   const char* name;
   std::size_t offset;
-  std::string type;
+  std::size_t size;
+  const char* type;      // in the JSON
+  std::string typeText;  // on the page
+  ordered_json more = ordered_json::object();
 };
 
 struct Description {
@@ -30,10 +41,18 @@ struct Description {
 };
 
 // An argument is a field of the request's struct.
+#define ARGUMENT(Request, field, name, type, ...) \
+  Argument { name, offsetof(Request, field), sizeof(Request::field), type, __VA_ARGS__ }
 #define TEXT(Request, field, name) \
-  Argument { name, offsetof(Request, field), "char[" + std::to_string(sizeof(Request::field)) + "]" }
-#define FIELD(Request, field, name, type) \
-  Argument { name, offsetof(Request, field), type }
+  ARGUMENT(Request, field, name, "text", "char[" + std::to_string(sizeof(Request::field)) + "]")
+#define INTEGER(Request, field, name) ARGUMENT(Request, field, name, "i32", "i32")
+#define DEGREES(Request, field, name) \
+  ARGUMENT(Request, field, name, "f64", "f64, degrees", {{"unit", "degrees"}})
+#define COUNT(Request, count) \
+  ARGUMENT(Request, descriptorCount, "descriptor count " #count, "descriptorCount", "u32", {{"value", count}})
+#define REGION(Request, field, name) ARGUMENT(Request, field, name, "region", "out-of-line descriptor")
+#define LENGTH(Request, field, name, region) \
+  ARGUMENT(Request, field, name, "regionSize", "u32", {{"region", region}})
 
 const char* const kPrefix = "BVMobileHelper";
 
@@ -42,8 +61,8 @@ std::vector<Description> descriptions() {
   return {
       {"CheckIn",
        sizeof(CheckInRequest),
-       {FIELD(CheckInRequest, descriptorCount, "descriptor count 1", "u32"),
-        FIELD(CheckInRequest, clientPort, "the caller's port", "port descriptor")},
+       {COUNT(CheckInRequest, 1),
+        ARGUMENT(CheckInRequest, clientPort, "the caller's port", "port", "port descriptor")},
        "Makes a client of the caller; the reply carries its channel.",
        "5 the caller's port has died already; 6 out of descriptors; 35 not entitled"},
       {"SetVoicemailToken",
@@ -66,10 +85,9 @@ std::vector<Description> descriptions() {
       {"CopyVoicemailToken", none, {}, "Returns the general token; empty when there is none.", ""},
       {"SetPreferenceValue",
        sizeof(SetPreferenceValueRequest),
-       {FIELD(SetPreferenceValueRequest, descriptorCount, "descriptor count 1", "u32"),
-        FIELD(SetPreferenceValueRequest, value, "value", "out-of-line descriptor"),
+       {COUNT(SetPreferenceValueRequest, 1), REGION(SetPreferenceValueRequest, value, "value"),
         TEXT(SetPreferenceValueRequest, domain, "domain"), TEXT(SetPreferenceValueRequest, key, "key"),
-        FIELD(SetPreferenceValueRequest, valueLength, "value length", "u32")},
+        LENGTH(SetPreferenceValueRequest, valueLength, "value length", "value")},
        "Stores a value, a property list in XML or binary form, for the helper's own user on any host. A "
        "value of "
        "exactly one byte removes the key.",
@@ -106,12 +124,18 @@ std::vector<Description> descriptions() {
       {"IsVoicemailServiceSubscribed", none, {}, "Tells whether visual voicemail is subscribed.", ""},
       {"CellularHeartbeat",
        sizeof(IntegerRequest),
-       {FIELD(IntegerRequest, value, "value", "i32")},
+       {INTEGER(IntegerRequest, value, "value")},
        "Non-zero: an echo every two seconds over the cellular interface, and the helper stays; 0: off.",
        ""},
       {"CheckLASDUpdate",
        sizeof(IntegerRequest),
-       {FIELD(IntegerRequest, value, "value", "i32")},
+       {ARGUMENT(IntegerRequest, value, "value", "i32", "i32",
+                 {{"bits",
+                   {{"umts", BVMH_LASD_UMTS},
+                    {"cdma", BVMH_LASD_CDMA},
+                    {"lte", BVMH_LASD_LTE},
+                    {"gsm", BVMH_LASD_GSM},
+                    {"scdma", BVMH_LASD_SCDMA}}}})},
        "Starts an update check of location-aware service databases, a bit each: umts 1, cdma 2, lte 4, gsm "
        "8, scdma "
        "16. The outcome comes as notifications. The reply's NDR record is unset on success.",
@@ -139,8 +163,7 @@ std::vector<Description> descriptions() {
        ""},
       {"RequestCountryCodeFromLocation",
        sizeof(CoordinateRequest),
-       {FIELD(CoordinateRequest, latitude, "latitude", "f64, degrees"),
-        FIELD(CoordinateRequest, longitude, "longitude", "f64, degrees")},
+       {DEGREES(CoordinateRequest, latitude, "latitude"), DEGREES(CoordinateRequest, longitude, "longitude")},
        "Asks for the civic address of a place. It comes as a push, within about five seconds. Both exactly "
        "0: the push "
        "holds the configured country only.",
@@ -155,7 +178,7 @@ std::vector<Description> descriptions() {
        ""},
       {"EnableRadioManagerLogs",
        sizeof(IntegerRequest),
-       {FIELD(IntegerRequest, value, "enable", "i32")},
+       {INTEGER(IntegerRequest, value, "enable")},
        "Non-zero: the radio manager logs to a file; 0: it does not.",
        ""},
       {"UnpackArchive",
@@ -172,22 +195,20 @@ std::vector<Description> descriptions() {
        "3 or 6 no memory for the region; 9 missing, unreadable, or something else"},
       {"CopyBadgeLabels",
        sizeof(LabelsRequest),
-       {FIELD(LabelsRequest, descriptorCount, "descriptor count 2", "u32"),
-        FIELD(LabelsRequest, labels, "labels", "out-of-line descriptor"),
-        FIELD(LabelsRequest, languages, "languages", "out-of-line descriptor"),
-        FIELD(LabelsRequest, labelsLength, "labels length", "u32"),
-        FIELD(LabelsRequest, languagesLength, "languages length", "u32")},
+       {COUNT(LabelsRequest, 2), REGION(LabelsRequest, labels, "labels"),
+        REGION(LabelsRequest, languages, "languages"),
+        LENGTH(LabelsRequest, labelsLength, "labels length", "labels"),
+        LENGTH(LabelsRequest, languagesLength, "languages length", "languages")},
        "Returns short labels, an array of texts. `labels`: an array of pairs, a label key and a text that is "
        "not looked "
        "at, or an empty text and a label's own text. `languages`: an array of texts.",
        "3 or 6 no memory for the region; 5 an argument that is no array, or no label in it"},
       {"CopyLocalizedLabels",
        sizeof(LabelsRequest),
-       {FIELD(LabelsRequest, descriptorCount, "descriptor count 2", "u32"),
-        FIELD(LabelsRequest, labels, "labels", "out-of-line descriptor"),
-        FIELD(LabelsRequest, languages, "languages", "out-of-line descriptor"),
-        FIELD(LabelsRequest, labelsLength, "labels length", "u32"),
-        FIELD(LabelsRequest, languagesLength, "languages length", "u32")},
+       {COUNT(LabelsRequest, 2), REGION(LabelsRequest, labels, "labels"),
+        REGION(LabelsRequest, languages, "languages"),
+        LENGTH(LabelsRequest, labelsLength, "labels length", "labels"),
+        LENGTH(LabelsRequest, languagesLength, "languages length", "languages")},
        "Returns the names of predefined labels, an array of texts. `labels`: an array of label keys. "
        "`languages`: as "
        "above.",
@@ -219,37 +240,225 @@ const char* nameOf(ReplyForm form) {
   return "?";
 }
 
-bool printRow(const RoutineFacts& routine, const Description& description) {
-  if (routine.name != kPrefix + std::string(description.routine) || routine.requestSize != description.size) {
-    std::fprintf(stderr, "protocol-table: the row of %s does not fit\n", description.routine);
-    return false;
-  }
+// Whether the words fit the row of the routine.
+bool fits(const RoutineFacts& routine, const Description& description) {
+  if (routine.name == kPrefix + std::string(description.routine) && routine.requestSize == description.size)
+    return true;
+  std::fprintf(stderr, "protocol-table: the row of %s does not fit\n", description.routine);
+  return false;
+}
+
+void printRow(const RoutineFacts& routine, const Description& description) {
   std::string arguments = std::to_string(routine.requestSize);
   const char* separator = ": ";
   for (const Argument& each : description.arguments) {
     arguments +=
-        separator + std::string(each.name) + " (" + std::to_string(each.offset) + ", " + each.type + ")";
+        separator + std::string(each.name) + " (" + std::to_string(each.offset) + ", " + each.typeText + ")";
     separator = ", ";
   }
   std::printf("| %d | `%s` | %s | %s, %zu | %s | %s |\n", routine.id, description.routine, arguments.c_str(),
               nameOf(routine.reply), sizeOfReply(routine.reply), description.meaning, description.codes);
-  return true;
 }
 
-}  // namespace
-
-int main() {
-  const std::vector<Description> all = descriptions();
-  if (all.size() != 1 + kRequestRoutines.size()) {
-    std::fprintf(stderr, "protocol-table: %zu rows described\n", all.size());
-    return EXIT_FAILURE;
-  }
+void printTable(const std::vector<const RoutineFacts*>& routines, const std::vector<Description>& all) {
   std::printf(
       "| Id | Routine | Request: size, then arguments (offset, type) | Reply: form, size | What it does | "
       "Codes |\n");
   std::printf("|---|---|---|---|---|---|\n");
-  bool isRight = printRow(kCheckInRoutine, all[0]);
-  for (std::size_t i = 0; i < kRequestRoutines.size(); ++i)
-    isRight &= printRow(kRequestRoutines[i], all[i + 1]);
-  return isRight ? EXIT_SUCCESS : EXIT_FAILURE;
+  for (std::size_t i = 0; i < routines.size(); ++i) printRow(*routines[i], all[i]);
+}
+
+// ---- JSON -----------------------------------------------------------------------------------------------
+
+// "link path": "link_path"
+std::string identifierOf(const Argument& argument) {
+  const std::string type = argument.type;
+  if (type == "descriptorCount") return "descriptor_count";
+  std::string name = argument.name;
+  if (name == "the caller's port") return "client_port";
+  std::replace(name.begin(), name.end(), ' ', '_');
+  return name;
+}
+
+ordered_json jsonOf(const Argument& argument) {
+  ordered_json json{{"name", identifierOf(argument)},
+                    {"offset", argument.offset},
+                    {"size", argument.size},
+                    {"type", argument.type}};
+  json.update(argument.more);
+  return json;
+}
+
+ordered_json jsonOf(const std::vector<Argument>& arguments) {
+  ordered_json json = ordered_json::array();
+  for (const Argument& each : arguments) json.push_back(jsonOf(each));
+  return json;
+}
+
+ordered_json jsonOf(const RoutineFacts& routine, const Description& description) {
+  return {{"id", routine.id},
+          {"name", description.routine},
+          {"requestSize", routine.requestSize},
+          {"descriptors", routine.descriptors},
+          {"arguments", jsonOf(description.arguments)},
+          {"reply", nameOf(routine.reply)},
+          {"meaning", description.meaning},
+          {"codes", description.codes}};
+}
+
+#define FIELD(Struct, field, name, type) ARGUMENT(Struct, field, name, type, "")
+#define STATUS_FIELDS FIELD(StatusReply, ndr, "ndr", "ndr"), FIELD(StatusReply, returnCode, "code", "i32")
+#define REPLY(form, Struct, ...)                                   \
+  {                                                                \
+    {"form", nameOf(ReplyForm::form)}, {"size", sizeof(Struct)}, { \
+      "fields", jsonOf(std::vector<Argument>{__VA_ARGS__})         \
+    }                                                              \
+  }
+
+ordered_json elements() {
+  return {
+      {"header",
+       {{"size", sizeof(MessageHeader)},
+        {"fields",
+         jsonOf(std::vector<Argument>{
+             FIELD(MessageHeader, bits, "bits", "u32"), FIELD(MessageHeader, size, "size", "u32"),
+             FIELD(MessageHeader, replyPort, "reply_port", "u32"),
+             FIELD(MessageHeader, localPort, "local_port", "u32"),
+             FIELD(MessageHeader, voucher, "voucher", "u32"), FIELD(MessageHeader, id, "id", "i32")})}}},
+      {"portDescriptor",
+       {{"size", sizeof(PortDescriptor)},
+        {"kind", kPortDescriptorType},
+        {"fields", jsonOf(std::vector<Argument>{FIELD(PortDescriptor, name, "name", "u32"),
+                                                FIELD(PortDescriptor, disposition, "disposition", "u8"),
+                                                FIELD(PortDescriptor, type, "kind", "u8")})}}},
+      {"outOfLineDescriptor",
+       {{"size", sizeof(OutOfLineDescriptor)},
+        {"kind", kOutOfLineDescriptorType},
+        {"fields", jsonOf(std::vector<Argument>{FIELD(OutOfLineDescriptor, address, "address", "u64"),
+                                                FIELD(OutOfLineDescriptor, deallocate, "deallocate", "u8"),
+                                                FIELD(OutOfLineDescriptor, copy, "copy", "u8"),
+                                                FIELD(OutOfLineDescriptor, type, "kind", "u8"),
+                                                FIELD(OutOfLineDescriptor, size, "size", "u32")})}}}};
+}
+
+ordered_json constants() {
+  return {{"ndr", std::vector<int>(std::begin(kNdrRecord.bytes), std::end(kNdrRecord.bytes))},
+          {"complexBit", kComplexBit},
+          {"replyDisposition", kReplyDisposition},
+          {"replyIdOffset", kReplyIdOffset},
+          {"largestDatagram", kLargestDatagram},
+          {"descriptorCountOffset", kDescriptorCountOffset},
+          {"descriptorsOffset", kDescriptorsOffset},
+          {"regionAlignment", 8},
+          {"checkInDisposition", kDispositionMoveSend},
+          {"checkInReplyDisposition", kDispositionCopySend},
+          {"copy", kVirtualCopy}};
+}
+
+ordered_json replyForms() {
+  const ordered_json forms = {
+      REPLY(status, StatusReply, STATUS_FIELDS),
+      REPLY(integer, IntegerReply, STATUS_FIELDS,
+            Argument{"result", offsetof(IntegerReply, result), 1, "boolean", ""}),
+      REPLY(string64, String64Reply, STATUS_FIELDS, FIELD(String64Reply, text, "result", "text")),
+      REPLY(string256, String256Reply, STATUS_FIELDS, FIELD(String256Reply, text, "result", "text")),
+      REPLY(outOfLine, OutOfLineReply, COUNT(OutOfLineReply, 1),
+            FIELD(OutOfLineReply, payload, "result", "region"), FIELD(OutOfLineReply, ndr, "ndr", "ndr"),
+            LENGTH(OutOfLineReply, byteCount, "result size", "result")),
+      REPLY(checkIn, CheckInReply, COUNT(CheckInReply, 1),
+            Argument{"channel", offsetof(CheckInReply, servicePort), sizeof(CheckInReply::servicePort),
+                     "port", ""}),
+  };
+  return forms;
+}
+
+// The codes with the words of the client library.
+ordered_json codes() {
+  struct Named {
+    KernelReturn code;
+    const char* name;
+  };
+  static_assert(kern::noSpace == BVMH_NO_SPACE && kern::failure == BVMH_FAILURE &&
+                kern::resourceShortage == BVMH_RESOURCE_SHORTAGE && kern::noAccess == BVMH_NO_ACCESS &&
+                kern::memoryFailure == BVMH_MEMORY_FAILURE &&
+                kern::invalidSecurity == BVMH_INVALID_SECURITY && mig::typeError == BVMH_TYPE_ERROR &&
+                mig::badId == BVMH_BAD_ID && mig::badArguments == BVMH_BAD_ARGUMENTS &&
+                mig::trailerError == BVMH_TRAILER_ERROR);
+  ordered_json json = ordered_json::array();
+  for (const Named& each :
+       {Named{kern::success, "success"}, Named{kern::noSpace, "noSpace"}, Named{kern::failure, "failure"},
+        Named{kern::resourceShortage, "resourceShortage"}, Named{kern::noAccess, "noAccess"},
+        Named{kern::memoryFailure, "memoryFailure"}, Named{kern::invalidSecurity, "invalidSecurity"},
+        Named{BVMH_NOT_SUPPORTED, "notSupported"}, Named{mig::typeError, "typeError"},
+        Named{mig::badId, "badId"}, Named{mig::badArguments, "badArguments"},
+        Named{mig::trailerError, "trailerError"}}) {
+    json.push_back({{"code", each.code}, {"name", each.name}, {"meaning", bvmh_error_text(each.code)}});
+  }
+  return json;
+}
+
+ordered_json pushes() {
+  return {{"service", kTelephonyServiceName},
+          {"requestSize", sizeof(TelephonyPushMessage)},
+          {"arguments", jsonOf(std::vector<Argument>{COUNT(TelephonyPushMessage, 1),
+                                                     FIELD(TelephonyPushMessage, values, "values", "region"),
+                                                     FIELD(TelephonyPushMessage, ndr, "ndr", "ndr")})},
+          {"replySize", sizeof(TelephonyPushReply)},
+          {"replyFields", jsonOf(std::vector<Argument>{FIELD(TelephonyPushReply, ndr, "ndr", "ndr"),
+                                                       FIELD(TelephonyPushReply, returnCode, "code", "i32"),
+                                                       FIELD(TelephonyPushReply, result, "result", "u64")})},
+          {"clientKey", kClientKey},
+          {"messages",
+           {{{"id", kSetCivicInfoMessageId},
+             {"name", "SetCivicInfoBasedOnCurrentLocation"},
+             {"keys", {kCountryCodeKey, kStateKey, kCityKey, kPostalCodeKey}}},
+            {{"id", kSetLocalRoutableAddressMessageId},
+             {"name", "SetLocalRoutableAddress"},
+             {"keys", ordered_json::array({kAddressKey})}}}}};
+}
+
+ordered_json notifications() {
+  return {{"service", kNotificationServiceName},
+          {"id", kNotificationMessageId},
+          {"kindKey", "Notification"},
+          {"databaseKey", "DBType"},
+          {"kinds",
+           {"com.norvale.lasd.UpdateAvailable", "com.norvale.lasd.NoUpdateRequired",
+            "com.norvale.lasd.UpdateFailed"}},
+          {"databases", {"gsm", "umts", "cdma", "lte", "scdma"}}};
+}
+
+void printJson(const std::vector<const RoutineFacts*>& routines, const std::vector<Description>& all) {
+  ordered_json json{
+      {"format", 1}, {"service", kServiceName}, {"prefix", kPrefix}, {"constants", constants()}};
+  json.update(elements());
+  json["replyForms"] = replyForms();
+  json["routines"] = ordered_json::array();
+  for (std::size_t i = 0; i < routines.size(); ++i) json["routines"].push_back(jsonOf(*routines[i], all[i]));
+  json["codes"] = codes();
+  json["pushes"] = pushes();
+  json["notifications"] = notifications();
+  std::printf("%s\n", json.dump(2).c_str());
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  const bool asJson = argc == 2 && std::strcmp(argv[1], "json") == 0;
+  if (argc != 1 && !asJson) {
+    std::fprintf(stderr, "usage: protocol-table [json]\n");
+    return 2;
+  }
+  std::vector<const RoutineFacts*> routines{&kCheckInRoutine};
+  for (const RoutineFacts& each : kRequestRoutines) routines.push_back(&each);
+  const std::vector<Description> all = descriptions();
+  if (all.size() != routines.size()) {
+    std::fprintf(stderr, "protocol-table: %zu rows described\n", all.size());
+    return EXIT_FAILURE;
+  }
+  bool isRight = true;
+  for (std::size_t i = 0; i < routines.size(); ++i) isRight &= fits(*routines[i], all[i]);
+  if (!isRight) return EXIT_FAILURE;
+  asJson ? printJson(routines, all) : printTable(routines, all);
+  return EXIT_SUCCESS;
 }

@@ -1,16 +1,21 @@
 #!/usr/bin/env python3
 # SPDX-License-Identifier: Apache-2.0
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-"""The installed C library, used as other projects use it: pkg-config, CMake, shared and static, from C and C++.
+"""The installed C library, used as other projects use it: pkg-config, CMake, shared and static, from C and C++; and its
+examples.
 
 BRENVIK_BUILD names the build folder, BRENVIK_SOURCE the project's.
 """
 import os
 import pathlib
+import plistlib
 import re
 import shlex
+import socket
+import struct
 import subprocess
 import tempfile
+import threading
 import unittest
 
 from fake_helper import FakeHelper
@@ -18,6 +23,7 @@ from fake_helper import FakeHelper
 BUILD = pathlib.Path(os.environ["BRENVIK_BUILD"])
 SOURCE = pathlib.Path(os.environ["BRENVIK_SOURCE"])
 CONSUMER = SOURCE / "client" / "consumer"
+EXAMPLES = SOURCE / "client" / "examples"
 STRICT = ["-Wall", "-Wextra", "-Wpedantic", "-Werror"]
 
 
@@ -40,6 +46,21 @@ class InstalledClient(unittest.TestCase):
     def config(self, *arguments):
         environment = {**os.environ, "PKG_CONFIG_PATH": str(self.library.parent / "pkgconfig")}
         return shlex.split(run("pkg-config", *arguments, "brenvik-mobile-helper", env=environment))
+
+    def example(self, *path):
+        """Compiles an example with the very line that it gives itself, and with warnings; returns the program."""
+        source = EXAMPLES.joinpath(*path)
+        line = re.search(r"^ \*   cc (.*)$", source.read_text(), flags=re.M)[1]
+        folder = self.folder / ("example-" + source.stem)
+        folder.mkdir()
+        (folder / source.name).write_text(source.read_text())
+        run("sh", "-c", " ".join(["cc", "-std=c11", "-D_DEFAULT_SOURCE", *STRICT, line]), cwd=folder,
+            env={**os.environ, "PKG_CONFIG_PATH": str(self.library.parent / "pkgconfig")})
+        return folder / source.stem
+
+    def run_example(self, program, path):
+        return subprocess.run([program, path], env={**os.environ, "LD_LIBRARY_PATH": str(self.library.parent)},
+                              capture_output=True, text=True, timeout=60, check=False)
 
     def expect_working(self, program):
         path = self.folder / "helper"
@@ -70,12 +91,99 @@ class InstalledClient(unittest.TestCase):
             *self.config("--cflags", "--libs"))
         self.expect_working(program)
 
+    def test_the_examples_in_cpp_compile_in_both_languages_and_do_what_they_say(self):
+        environment = {**os.environ, "LD_LIBRARY_PATH": str(self.library.parent)}
+        stored = []
+
+        def answer(request):
+            if request.id == 8683555:
+                stored.append(request.region())
+                return request.status(0)
+            return request.payload(stored[-1]) if request.id == 8683556 else request.string("DE", 64)
+
+        def push(request):
+            region = plistlib.dumps({"CountryCode": "NO", "City": "Oslo"}, fmt=plistlib.FMT_BINARY)
+            with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as sender:
+                sender.connect(str(self.folder / "com.norvale.brenvik"))
+                sender.send(struct.pack("<IIIIIi", 0x80000012, 52, 7, 0, 0, 9100001) + struct.pack(
+                    "<IQBBBBI", 1, 56, 0, 1, 0, 1, len(region)) + bytes([0, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0]) + region)
+                self.assertEqual(len(sender.recv(100)), 44)
+            return request.status(0)
+
+        def push_later(request):
+            threading.Thread(target=push, args=(request,)).start()
+            return request.status(0)
+
+        for standard in ("c++20", "c++23"):
+            for name, work, words, expected in (
+                    ("preferences", answer, [], "51 bytes of XML\ncountry \"DE\"\n"),
+                    ("pushes", push_later, [self.folder], 'country "NO", city "Oslo"\n')):
+                program = self.folder / f"{name}-{standard}"
+                run("c++", f"-std={standard}", *STRICT, "-Wconversion", "-Wold-style-cast",
+                    SOURCE / "client" / "examples" / "cpp" / f"{name}.cpp", "-o", program, *self.config("--cflags", "--libs"))
+                path = self.folder / "helper"
+                with FakeHelper(path, work):
+                    self.assertEqual(run(program, path, *words, env=environment), expected)
+                path.unlink()
+                failed = subprocess.run([program, path, *words], env=environment, capture_output=True, text=True, timeout=60)
+                self.assertEqual((failed.returncode, failed.stderr), (1, "cannot connect: no helper answers at its socket\n"))
+
+    def test_every_program_of_the_page_about_cpp_prints_what_stands_below_it(self):
+        page = (SOURCE / "docs" / "cpp.md").read_text()
+        programs = re.findall(r"^```cpp\n(.*?)^```\n```text\n(.*?)^```$", page, re.M | re.S)
+        self.assertEqual(len(programs), 4)
+        script = self.folder / "script"
+        script.write_text('on SetVoicemailToken\non CopyCountryCode\n answer "NO"\non LoadPlistFile\n fail 9\n'
+                          'on SetPreferenceValue value={"text": "Hello"}\non CopyLocalizedLabels\n answer ["Reise"]\n'
+                          'on RequestCountryCodeFromLocation\n push civic-info City="Oslo"\n')
+        for number, (code, expected) in enumerate(programs):
+            source, program = self.folder / f"page-{number}.cpp", self.folder / f"page-{number}"
+            source.write_text(code)
+            run("c++", "-std=c++20", *STRICT, source, "-o", program, *self.config("--cflags", "--libs"))
+            done = subprocess.run([BUILD / "brenvik-mobile-helper-mock", script, "--", program], capture_output=True, text=True,
+                                  timeout=60, env={**os.environ, "LD_LIBRARY_PATH": str(self.library.parent)})
+            if "namespaces" in done.stderr:
+                self.skipTest("this system lets no program make namespaces")
+            self.assertEqual((done.returncode, done.stdout, done.stderr), (0, expected, ""))
+
     def test_through_cmake(self):
         build = self.folder / "consumer"
         run("cmake", "-S", CONSUMER, "-B", build, f"-DCMAKE_PREFIX_PATH={self.prefix}")
         run("cmake", "--build", build)
         for program in ("shared", "static"):
             self.expect_working(build / program)
+
+    def test_the_examples_of_event_loops_print_what_they_asked_for(self):
+        answers = {8683568: lambda request: request.string("NO", 64), 8683554: lambda request: request.string("t", 256)}
+        for source in ("sd-event.c", "glib.c"):
+            with self.subTest(source):
+                program = self.example("event-loops", source)
+                path = self.folder / "loop-helper"
+                with FakeHelper(path, lambda request: answers[request.id](request)):
+                    ended = self.run_example(program, path)
+                self.assertEqual((ended.returncode, ended.stdout, ended.stderr),
+                                 (0, 'country: "NO"\ntoken: "t"\n', ""))
+                path.unlink()
+                with FakeHelper(path, refusal=35):
+                    refused = self.run_example(program, path)
+                path.unlink()
+                self.assertEqual((refused.returncode, refused.stderr.count("the caller lacks the entitlement")), (1, 3))
+
+    def test_the_example_of_values_stores_and_reads_a_dictionary(self):
+        program = self.example("values", "preferences.c")
+        stored = []
+
+        def answer(request):
+            if request.id == 8683555:
+                stored.append(plistlib.loads(request.region()))
+                return request.status(0)
+            return request.payload(plistlib.dumps(stored[-1]))
+
+        path = self.folder / "values-helper"
+        with FakeHelper(path, answer):
+            ended = self.run_example(program, path)
+        self.assertEqual((ended.returncode, ended.stdout, ended.stderr), (0, "carrier Example, bands 1 3 20\n", ""))
+        self.assertEqual(stored, [{"Carrier": "Example", "Version": 7, "Bands": [1, 3, 20]}])
 
     def test_the_shared_library_exports_what_the_header_declares(self):
         header = (self.prefix / "include" / "brenvik" / "mobile_helper.h").read_text()
@@ -84,12 +192,14 @@ class InstalledClient(unittest.TestCase):
         exported = {name.split("@")[0] for _, kind, name in symbols if kind == "T"}
         self.assertEqual(exported, declared)
         self.assertEqual({name for _, kind, name in symbols if kind not in "TA"}, set())
-        self.assertEqual(len({name for name in exported if name.startswith("BVMobileHelper")}), 27)
+        routines = {name for name in exported if name.startswith("BVMobileHelper") and not name.endswith("Begin")}
+        self.assertEqual(len(routines), 27)
+        self.assertEqual({name for name in exported if name.endswith("Begin")}, {name + "Begin" for name in routines})
         self.assertIn("libbrenvik-mobile-helper.so.0", re.search(r"SONAME +(\S+)", run("objdump", "-p", self.library))[1])
 
     def test_the_shared_library_needs_the_c_and_cpp_libraries_only(self):
         needed = set(re.findall(r"NEEDED +(\S+)", run("objdump", "-p", self.library)))
-        self.assertLessEqual(needed, {"libc.so.6", "libstdc++.so.6", "libgcc_s.so.1"})
+        self.assertLessEqual(needed, {"libc.so.6", "libm.so.6", "libstdc++.so.6", "libgcc_s.so.1"})
 
     def test_the_library_alone_builds_without_any_other_package(self):
         build = self.folder / "client-only"

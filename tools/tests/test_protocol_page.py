@@ -5,6 +5,7 @@
 
 BRENVIK_BUILD names the build folder, BRENVIK_SOURCE the project's.
 """
+import json
 import os
 import pathlib
 import plistlib
@@ -14,9 +15,12 @@ import sys
 import tempfile
 import unittest
 
+import jsonschema
+
 from fake_helper import FakeHelper, Request
 
 BUILD = pathlib.Path(os.environ["BRENVIK_BUILD"])
+INTERFACE = pathlib.Path(os.environ["BRENVIK_SOURCE"]) / "interface"
 PAGE = (pathlib.Path(os.environ["BRENVIK_SOURCE"]) / "docs" / "protocol.md").read_text(encoding="utf-8")
 
 
@@ -89,6 +93,55 @@ class ProtocolPage(unittest.TestCase):
             default = re.search(rf'^set\({name} "([^"]*)"', options, re.M)[1]
             default = default.removeprefix("${PROJECT_SOURCE_DIR}/")
             self.assertEqual(value.strip("`"), default or "empty", name)
+
+
+class ProtocolAsJson(unittest.TestCase):
+    """interface/protocol.json, from which bindings of other languages are made."""
+
+    @classmethod
+    def setUpClass(cls):
+        cls.text = (INTERFACE / "protocol.json").read_text(encoding="utf-8")
+        cls.table = json.loads(cls.text)
+
+    def test_it_is_what_the_code_says(self):
+        printed = subprocess.run([BUILD / "protocol-table", "json"], capture_output=True, text=True, check=True).stdout
+        self.assertEqual(self.text, printed, "put what `build/.../protocol-table json` prints into interface/protocol.json")
+
+    def test_it_fits_its_schema_and_the_schema_is_strict(self):
+        schema = json.loads((INTERFACE / "protocol.schema.json").read_text(encoding="utf-8"))
+        validator = jsonschema.Draft202012Validator(schema)
+        validator.check_schema(schema)
+        validator.validate(self.table)
+        for spoil in (lambda table: table.pop("codes"), lambda table: table["routines"][3].update(reply="number"),
+                      lambda table: table["routines"][1]["arguments"][0].update(surprise=1)):
+            spoilt = json.loads(self.text)
+            spoil(spoilt)
+            self.assertFalse(validator.is_valid(spoilt))
+
+    def test_every_byte_of_a_request_has_one_meaning(self):
+        header, ndr = self.table["header"]["size"], len(self.table["constants"]["ndr"])
+        for each in self.table["routines"]:
+            used = [(0, header)] + [(field["offset"], field["size"]) for field in each["arguments"]]
+            if each["arguments"] and each["name"] != "CheckIn":
+                descriptors = [field for field in each["arguments"] if field["type"] == "region"]
+                used.append((descriptors[-1]["offset"] + descriptors[-1]["size"] if descriptors else header, ndr))
+            at = 0
+            for offset, size in sorted(used):
+                self.assertEqual(offset, at, each["name"])
+                at += size
+            self.assertEqual(at, each["requestSize"], each["name"])
+
+    def test_the_page_has_its_codes_forms_and_pushes(self):
+        codes = re.search(r"^\| Code \| \|\n\|.*\n((?:\|.*\n)+)", PAGE, re.M)[1]
+        on_page = {int(number) for row in codes.splitlines() for number in re.findall(r"-?\d+", row.split("|")[1])}
+        self.assertEqual(on_page, {each["code"] for each in self.table["codes"]})
+        for each in self.table["replyForms"]:
+            self.assertRegex(PAGE, rf"(?m)^\| {each['form']} \| {each['size']}\b")
+        for each in self.table["pushes"]["messages"]:
+            keys = ", ".join(f"`{key}`" for key in each["keys"])
+            self.assertIn(f"| {each['id']} | `{each['name']}` | {keys} |", PAGE)
+        for kind in self.table["notifications"]["kinds"]:
+            self.assertIn(f"| `{kind}` |", PAGE)
 
 
 if __name__ == "__main__":

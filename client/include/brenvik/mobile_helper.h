@@ -12,10 +12,10 @@
  *   if (code != BVMH_OK) fprintf(stderr, "%s\n", bvmh_error_text(code));
  *   bvmh_client_free(client);
  *
- * Threads: an object (client or listener) may be used by one thread at a time, any thread; different
- * objects are independent. Nothing here touches signals, the working directory or the environment; SIGPIPE is
- * never raised, every descriptor is close-on-exec. After fork() only one of the two processes may go on
- * using an object.
+ * Threads: an object (client, listener or value) may be used by one thread at a time, any thread; different
+ * objects are independent. bvmh_client_interrupt alone may be called at any time. Nothing here touches
+ * signals, the working directory or the environment; SIGPIPE is never raised, every descriptor is
+ * close-on-exec. After fork() only one of the two processes may go on using an object.
  *
  * Texts are UTF-8 and end with a NUL. Paths are read by the helper, in its own working directory and under
  * its own account: give absolute ones.
@@ -36,6 +36,18 @@
 #ifdef __cplusplus
 extern "C" {
 #endif
+
+/* ---- version --------------------------------------------------------------------------------------------
+ */
+
+/* The version of this header; bvmh_version() is the version of the library that is loaded. Programs that were
+ * built against an older 0.x or the same one run with it. */
+#define BVMH_VERSION_MAJOR 0
+#define BVMH_VERSION_MINOR 1
+#define BVMH_VERSION_PATCH 0
+#define BVMH_VERSION_NUMBER(major, minor, patch) (((major) << 16) | ((minor) << 8) | (patch))
+#define BVMH_VERSION BVMH_VERSION_NUMBER(BVMH_VERSION_MAJOR, BVMH_VERSION_MINOR, BVMH_VERSION_PATCH)
+BVMH_API uint32_t bvmh_version(void);
 
 /* ---- results ------------------------------------------------------------------------------------------- */
 
@@ -63,6 +75,14 @@ enum {
 
   /* the transport's own */
   BVMH_ERROR_FIRST = -7099,
+  BVMH_ERROR_NAME_LOST = -7020,    /* listener: its socket file is gone; nobody can connect to it any more */
+  BVMH_ERROR_NOT_ASKED = -7019,    /* push: no question of this client is under way that it could answer */
+  BVMH_ERROR_AMBIGUOUS = -7018,    /* push: more than one question is under way that it could answer */
+  BVMH_ERROR_NOT_A_VALUE = -7017,  /* value: the bytes are no property list, or one beyond a limit */
+  BVMH_ERROR_NO_SUCH_CALL = -7016, /* begun call: cancelled, its result was taken, or never begun */
+  BVMH_ERROR_IN_PROGRESS = -7015,  /* begun call: there is no result yet */
+  BVMH_ERROR_TOO_MANY_CALLS = -7014,  /* begun call: BVMH_MOST_CALLS are there already; nothing was sent */
+  BVMH_ERROR_INTERRUPTED = -7013,     /* bvmh_client_interrupt; what was sent may still be carried out */
   BVMH_ERROR_NOT_HANDED_OVER = -7012, /* listener: the service manager gave this process no such socket */
   BVMH_ERROR_NO_LONGER_THERE = -7011, /* listener: the sender of the push has gone */
   BVMH_ERROR_NAME_IN_USE = -7010,     /* listener: another live process serves the name */
@@ -118,13 +138,22 @@ BVMH_API const char* bvmh_bootstrap_directory(void);
  * then be entitled. BVMH_ERROR_UNREACHABLE: no helper.
  */
 BVMH_API BVMH_CHECKED int32_t bvmh_connect(bvmh_client* client);
-/* Leaves the helper. Answers still to come are lost. */
+/* Leaves the helper. Answers still to come are lost: calls that were begun end with BVMH_ERROR_ANSWER_LOST
+ * when they had been sent, else with BVMH_ERROR_NOT_CONNECTED. */
 BVMH_API void bvmh_disconnect(bvmh_client* client);
 /* bvmh_disconnect, then bvmh_connect. */
 BVMH_API BVMH_CHECKED int32_t bvmh_reconnect(bvmh_client* client);
 /* The errno behind the last BVMH_ERROR_UNREACHABLE or BVMH_ERROR_SYSTEM of this client, EACCES behind a
  * BVMH_INVALID_SECURITY of the kernel's; else 0. */
 BVMH_API int bvmh_client_errno(const bvmh_client* client);
+/*
+ * Makes the blocking call that is under way on this client return BVMH_ERROR_INTERRUPTED at once; when none
+ * is, the next one does, before it sends anything. One call for each time. May be called from any thread and
+ * from a signal handler, as long as the client is not being freed. The client stays usable; a call that was
+ * waiting alone may cost it its channel, and the next one then checks in again by itself. Calls that were
+ * begun are not concerned, nor is the listener. NULL is allowed.
+ */
+BVMH_API void bvmh_client_interrupt(bvmh_client* client);
 
 /*
  * A region of bytes that a routine returned. The caller owns it and frees it with bvmh_region_free.
@@ -133,7 +162,8 @@ BVMH_API int bvmh_client_errno(const bvmh_client* client);
 typedef struct bvmh_region {
   const void* bytes;
   size_t size;
-  void* owner; /* the library's */
+  void* owner;    /* the library's */
+  void* reserved; /* NULL */
 } bvmh_region;
 
 /* Frees the bytes and makes the region empty. NULL and an empty region are allowed. */
@@ -252,6 +282,182 @@ BVMH_API BVMH_CHECKED int32_t BVMobileHelperCheckLASDUpdate(bvmh_client* client,
 /* Non-zero: the radio manager logs to a file; 0: it does not. */
 BVMH_API BVMH_CHECKED int32_t BVMobileHelperEnableRadioManagerLogs(bvmh_client* client, int32_t enable);
 
+/* ---- calls that do not block ----------------------------------------------------------------------------
+ */
+
+/*
+ * For programs with an event loop. A call is begun, which never waits; bvmh_process does what can be done
+ * without waiting whenever bvmh_client_fd is readable; finished calls are then taken, in the order in which
+ * they finished:
+ *
+ *   bvmh_begin_connect(client, NULL, NULL);
+ *   BVMobileHelperCopyCountryCodeBegin(client, my_context, NULL);
+ *   ...
+ *   when the descriptor is readable:
+ *     bvmh_process(client);
+ *     while (bvmh_take_result(client, 0, &result) == BVMH_OK) {
+ *       use result.context, result.code, result.text;
+ *       bvmh_result_free(&result);
+ *     }
+ *
+ * Many calls may be under way on one client; the helper carries them out in the order in which they were
+ * begun. Each has the client's time-out, counted from when it was begun. Each ends with exactly one result,
+ * unless it is cancelled. Blocking calls may be made meanwhile: they wait for their turn, and keep the
+ * results of the others.
+ *
+ * When the helper leaves, the client checks in again by itself. Of the calls it had been sent, the oldest
+ * without an answer may have been carried out: it ends with BVMH_ERROR_ANSWER_LOST. The others have not
+ * been, for the helper reads a request when it has answered the one before; they are sent again, once.
+ */
+
+/* A begun call's number: never 0, not used twice by a client. */
+typedef uint64_t bvmh_call;
+
+/* How many calls a client can have that were begun and whose results were not taken. */
+#define BVMH_MOST_CALLS 4096
+
+typedef struct bvmh_result {
+  bvmh_call call;
+  void* context;              /* as it was given when the call was begun */
+  int32_t message_id;         /* of the routine, as docs/protocol.md numbers them; of a check-in 4792174 */
+  int32_t code;               /* what the blocking call would have returned */
+  int system_error;           /* the errno behind it, as bvmh_client_errno */
+  bool boolean;               /* routines with a bool: *success or *subscribed */
+  char text[BVMH_TOKEN_SIZE]; /* routines with a buffer: the token or the country code; else empty */
+  bvmh_region region;         /* routines with a region; else empty */
+  uint64_t reserved[4];
+} bvmh_result;
+
+/*
+ * A descriptor that is readable when bvmh_process has something to do, or while results wait to be taken. It
+ * is the client's own and stays the same as long as the client. -1: it could not be made, see
+ * bvmh_client_errno.
+ */
+BVMH_API int bvmh_client_fd(bvmh_client* client);
+/* Sends, receives and notices time-outs, as far as that needs no waiting. It is harmless to call it too
+ * often. BVMH_ERROR_INVALID_ARGUMENT for NULL, else BVMH_OK: how a call went is in its result. */
+BVMH_API int32_t bvmh_process(bvmh_client* client);
+/*
+ * Takes the result of a call, or, for 0, of the one that finished first; the caller frees it with
+ * bvmh_result_free. BVMH_ERROR_IN_PROGRESS: there is none yet. BVMH_ERROR_NO_SUCH_CALL: there will be none.
+ * The result is then empty.
+ */
+BVMH_API BVMH_CHECKED int32_t bvmh_take_result(bvmh_client* client, bvmh_call call, bvmh_result* result);
+/* Frees the region and empties the result. NULL and an empty result are allowed. */
+BVMH_API void bvmh_result_free(bvmh_result* result);
+/*
+ * Forgets a call: there will be no result, and one that is there already is freed. What was sent may still be
+ * carried out; its answer is recognised and dropped. BVMH_ERROR_NO_SUCH_CALL.
+ */
+BVMH_API int32_t bvmh_cancel(bvmh_client* client, bvmh_call call);
+
+/*
+ * Begins to check in; its result has the code that bvmh_connect would have returned. Further calls can be
+ * begun at once: they wait for it, and end with its code when it fails. The number of the call is stored in
+ * *call, which may be NULL; the context is handed back in the result.
+ */
+BVMH_API BVMH_CHECKED int32_t bvmh_begin_connect(bvmh_client* client, void* context, bvmh_call* call);
+
+/* Bytes that a call reads. */
+typedef struct bvmh_bytes {
+  const void* bytes;
+  size_t size;
+} bvmh_bytes;
+
+/*
+ * Begins any routine, by the number that docs/protocol.md has for it, with the bytes of its request as they
+ * are laid out there. The library fills in the header, the NDR record, the descriptors and the lengths of the
+ * regions, so they may be left as zeroes. As many regions as the routine has descriptors, in their order. All
+ * bytes are copied. BVMH_ERROR_INVALID_ARGUMENT: no such routine, another size, or another number of regions.
+ */
+BVMH_API BVMH_CHECKED int32_t bvmh_begin(bvmh_client* client, int32_t message_id, const void* request,
+                                         size_t size, const bvmh_bytes* regions, size_t region_count,
+                                         void* context, bvmh_call* call);
+
+/*
+ * One function a routine, which takes the arguments of the blocking one. They are copied. Other results than
+ * BVMH_OK mean that nothing was begun: BVMH_ERROR_INVALID_ARGUMENT, BVMH_ERROR_NOT_CONNECTED (neither
+ * bvmh_connect nor bvmh_begin_connect), BVMH_ERROR_TOO_MANY_CALLS, BVMH_ERROR_NO_MEMORY.
+ */
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperSetVoicemailTokenBegin(bvmh_client* client, const char* token,
+                                                                   void* context, bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperSetVoicemailTokenForKeyBegin(bvmh_client* client, const char* key,
+                                                                         const char* token, void* context,
+                                                                         bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperClearVoicemailTokenBegin(bvmh_client* client, void* context,
+                                                                     bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperResetVoicemailStoreBegin(bvmh_client* client, void* context,
+                                                                     bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyVoicemailTokenForKeyBegin(bvmh_client* client,
+                                                                          const char* key, void* context,
+                                                                          bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyVoicemailTokenBegin(bvmh_client* client, void* context,
+                                                                    bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperIsVoicemailServiceSubscribedBegin(bvmh_client* client,
+                                                                              void* context, bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperSetPreferenceValueBegin(bvmh_client* client, const char* domain,
+                                                                    const char* key, const void* value,
+                                                                    size_t length, void* context,
+                                                                    bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyPreferenceValueBegin(bvmh_client* client, const char* domain,
+                                                                     const char* key, void* context,
+                                                                     bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyAppPreferenceValueBegin(bvmh_client* client,
+                                                                        const char* domain, const char* key,
+                                                                        void* context, bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperLoadPlistFileBegin(bvmh_client* client, const char* path,
+                                                               void* context, bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperReplaceCarrierSymlinkBegin(bvmh_client* client,
+                                                                       const char* target,
+                                                                       const char* link_path,
+                                                                       const char* domain, void* context,
+                                                                       bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCreateSymlinkBegin(bvmh_client* client, const char* target,
+                                                               const char* link_path, void* context,
+                                                               bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperRemoveCarrierFileBegin(bvmh_client* client, const char* path,
+                                                                   const char* domain, void* context,
+                                                                   bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyCarrierFileBegin(bvmh_client* client,
+                                                                 const char* source_directory,
+                                                                 const char* destination_directory,
+                                                                 const char* file_name, void* context,
+                                                                 bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyCrashLogsBegin(bvmh_client* client, const char* path,
+                                                               void* context, bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperMoveIntoCarrierBundlesBegin(bvmh_client* client,
+                                                                        const char* source_path,
+                                                                        const char* destination_directory,
+                                                                        const char* name, void* context,
+                                                                        bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperUnpackArchiveBegin(bvmh_client* client, const char* archive_path,
+                                                               const char* destination_path, void* context,
+                                                               bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperRequestCountryCodeFromLocationBegin(
+    bvmh_client* client, double latitude, double longitude, void* context, bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperRequestWanIPFromLocationBegin(bvmh_client* client, void* context,
+                                                                          bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyCountryCodeBegin(bvmh_client* client, void* context,
+                                                                 bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyBadgeLabelsBegin(bvmh_client* client, const void* labels,
+                                                                 size_t labels_length, const void* languages,
+                                                                 size_t languages_length, void* context,
+                                                                 bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCopyLocalizedLabelsBegin(bvmh_client* client, const void* labels,
+                                                                     size_t labels_length,
+                                                                     const void* languages,
+                                                                     size_t languages_length, void* context,
+                                                                     bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperRemapContactsChannelBegin(bvmh_client* client, const char* from,
+                                                                      const char* to, void* context,
+                                                                      bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCellularHeartbeatBegin(bvmh_client* client, int32_t value,
+                                                                   void* context, bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperCheckLASDUpdateBegin(bvmh_client* client, int32_t value,
+                                                                 void* context, bvmh_call* call);
+BVMH_API BVMH_CHECKED int32_t BVMobileHelperEnableRadioManagerLogsBegin(bvmh_client* client, int32_t enable,
+                                                                        void* context, bvmh_call* call);
+
 /* ---- pushes and notifications -------------------------------------------------------------------------- */
 
 /* The telephony daemon's side: serves its two named services, on which the helper reports. */
@@ -307,15 +513,18 @@ typedef struct bvmh_event {
   uint32_t sender_uid;
   int32_t sender_pid;
   bool wants_reply;    /* bvmh_listener_reply is awaited; the helper waits at most a second for it */
-  uint64_t connection; /* the library's, as are the next two */
+  uint64_t connection; /* the library's, as is what follows */
   uint32_t reply_port;
   int32_t message_id;
+  uint64_t reserved[4];
 } bvmh_event;
 
 /*
  * Waits for the next push or notification, at most so many milliseconds (negative: for ever), and hands it
  * over; the caller frees it with bvmh_event_free. BVMH_ERROR_TIMED_OUT when none came; the event is
  * then empty. Messages that break the protocol are answered as the protocol says, and skipped.
+ * BVMH_ERROR_NAME_LOST, once for each: somebody has removed a socket file that bvmh_listener_create made, or
+ * its folder. What is connected is still served; to be found again, free the listener and create another one.
  */
 BVMH_API BVMH_CHECKED int32_t bvmh_listener_next(bvmh_listener* listener, int timeout_ms, bvmh_event* event);
 /* Answers a push: error code 0 is success. BVMH_ERROR_NO_LONGER_THERE when the helper no longer waits. */
@@ -327,7 +536,106 @@ BVMH_API BVMH_CHECKED int32_t bvmh_listener_reply(bvmh_listener* listener, const
  * is not a property list (the buffer then holds the empty text).
  */
 BVMH_API ptrdiff_t bvmh_event_text(const bvmh_event* event, const char* key, char* buffer, size_t capacity);
+/*
+ * Which location request of this client a push answers. The protocol does not say it, so the library infers
+ * it: one request of the push's kind, sent in the last ten seconds and not answered since, must be it.
+ * BVMH_OK: *call is the number of that begun call, 0 when it was a blocking one; the request counts as
+ * answered. BVMH_ERROR_AMBIGUOUS: there are several; one answer settles them all, so all count as answered.
+ * BVMH_ERROR_NOT_ASKED: there is none, as when another program asked, or the event is no push. `call` may be
+ * NULL.
+ */
+BVMH_API BVMH_CHECKED int32_t bvmh_match_push(bvmh_client* client, const bvmh_event* event, bvmh_call* call);
 BVMH_API void bvmh_event_free(bvmh_event* event);
+
+/* ---- values ---------------------------------------------------------------------------------------------
+ */
+
+/*
+ * Property lists: what preferences, labels, files, pushes and notifications are made of.
+ *
+ *   bvmh_value* labels = bvmh_value_new_array();
+ *   bvmh_value_append(labels, bvmh_value_new_text("USER_LABEL_BUSINESS"));
+ *   bvmh_region bytes;
+ *   int32_t code = bvmh_value_write(labels, &bytes);
+ *   bvmh_value_free(labels);
+ *
+ * Ownership: every bvmh_value* that a function here returns is the caller's, who frees it, or gives it to
+ * bvmh_value_append or bvmh_value_set, which take it over whether they succeed or not. Texts and bytes that
+ * are returned belong to the value they were asked of. Every function takes NULL for a value, and treats it
+ * like one of another type.
+ *
+ * Limits: 512 levels of arrays and dictionaries, and 64 MiB as XML.
+ */
+typedef struct bvmh_value bvmh_value;
+
+typedef enum bvmh_value_type {
+  BVMH_VALUE_NONE = 0, /* NULL */
+  BVMH_VALUE_BOOLEAN = 1,
+  BVMH_VALUE_INTEGER = 2,
+  BVMH_VALUE_REAL = 3,
+  BVMH_VALUE_TEXT = 4,
+  BVMH_VALUE_DATA = 5,
+  BVMH_VALUE_DATE = 6,
+  BVMH_VALUE_ARRAY = 7,
+  BVMH_VALUE_DICTIONARY = 8
+} bvmh_value_type;
+
+/* New values; what they are given is copied. NULL: out of memory, a null pointer, or a text that is not
+ * UTF-8. */
+BVMH_API bvmh_value* bvmh_value_new_boolean(bool value);
+BVMH_API bvmh_value* bvmh_value_new_integer(int64_t value);
+BVMH_API bvmh_value* bvmh_value_new_unsigned(uint64_t value);
+BVMH_API bvmh_value* bvmh_value_new_real(double value);
+BVMH_API bvmh_value* bvmh_value_new_text(const char* text);
+BVMH_API bvmh_value* bvmh_value_new_data(const void* bytes, size_t size);
+/* Seconds since 1970-01-01T00:00:00Z. */
+BVMH_API bvmh_value* bvmh_value_new_date(double seconds);
+/* Without elements or entries. */
+BVMH_API bvmh_value* bvmh_value_new_array(void);
+BVMH_API bvmh_value* bvmh_value_new_dictionary(void);
+/* Another handle of the same value; later changes of the one are not seen in the other. Costs little. */
+BVMH_API bvmh_value* bvmh_value_copy(const bvmh_value* value);
+BVMH_API void bvmh_value_free(bvmh_value* value);
+
+/* Adds an element behind the last one. BVMH_ERROR_INVALID_ARGUMENT: not an array, or element is NULL or the
+ * array itself; BVMH_ERROR_NO_MEMORY. The array is then as it was. */
+BVMH_API int32_t bvmh_value_append(bvmh_value* array, bvmh_value* element);
+/* Sets the value under a key, in the place of an earlier one. BVMH_ERROR_INVALID_ARGUMENT: not a dictionary,
+ * a key that is NULL or not UTF-8, or a value that is NULL or the dictionary itself; BVMH_ERROR_NO_MEMORY.
+ * The dictionary is then as it was. */
+BVMH_API int32_t bvmh_value_set(bvmh_value* dictionary, const char* key, bvmh_value* value);
+
+BVMH_API bvmh_value_type bvmh_value_type_of(const bvmh_value* value);
+/* The number of elements or entries; 0 for other types. */
+BVMH_API size_t bvmh_value_count(const bvmh_value* value);
+/* The element of an array, or the value of a dictionary's entry, in order. NULL: there is none, or out of
+ * memory. */
+BVMH_API bvmh_value* bvmh_value_at(const bvmh_value* value, size_t index);
+/* The key of a dictionary's entry, in order. NULL: there is none, or out of memory. It lives until the next
+ * call with this value. */
+BVMH_API const char* bvmh_value_key_at(bvmh_value* dictionary, size_t index);
+/* The value under a key. NULL: there is none, or out of memory. */
+BVMH_API bvmh_value* bvmh_value_find(const bvmh_value* dictionary, const char* key);
+
+/* True, and *out is written, when the value is of that type and fits. */
+BVMH_API bool bvmh_value_get_boolean(const bvmh_value* value, bool* out);
+BVMH_API bool bvmh_value_get_integer(const bvmh_value* value, int64_t* out);
+BVMH_API bool bvmh_value_get_unsigned(const bvmh_value* value, uint64_t* out);
+BVMH_API bool bvmh_value_get_real(const bvmh_value* value, double* out);
+/* Seconds since 1970-01-01T00:00:00Z. */
+BVMH_API bool bvmh_value_get_date(const bvmh_value* value, double* out);
+/* The text, closed with a NUL; its length, which counts NULs inside it, in *length, which may be NULL. NULL:
+ * not a text, or out of memory. It lives until the next call with this value. */
+BVMH_API const char* bvmh_value_get_text(bvmh_value* value, size_t* length);
+/* The bytes and, in *size, how many; they live as long as the value. NULL: not data. */
+BVMH_API const void* bvmh_value_get_data(const bvmh_value* value, size_t* size);
+
+/* Reads a property list, XML or binary. BVMH_ERROR_NOT_A_VALUE, BVMH_ERROR_NO_MEMORY,
+ * BVMH_ERROR_INVALID_ARGUMENT; *value is then NULL. */
+BVMH_API BVMH_CHECKED int32_t bvmh_value_read(const void* bytes, size_t size, bvmh_value** value);
+/* Writes a binary property list, as every routine takes it. BVMH_ERROR_NOT_A_VALUE: beyond a limit;
+ * BVMH_ERROR_NO_MEMORY, BVMH_ERROR_INVALID_ARGUMENT. The region is then empty. */
+BVMH_API BVMH_CHECKED int32_t bvmh_value_write(const bvmh_value* value, bvmh_region* bytes);
 
 #ifdef __cplusplus
 }

@@ -1,0 +1,45 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <sys/uio.h>
+
+#include <array>
+#include <cstddef>
+#include <span>
+
+#include "client/Region.h"
+
+namespace brenvik::client {
+
+// No routine has more descriptors.
+inline constexpr std::size_t kMostRegions = 2;
+
+using Regions = std::span<const std::span<const std::byte>>;
+
+// A request as it is handed to the kernel: the message, then the regions that fit the datagram, each at a
+// multiple of 8; the others in sealed memory of their own. Refers to the bytes it is made of.
+class Outgoing {
+ public:
+  // Fills in the message's descriptors, one for each region, in their order. False with errno set when memory
+  // cannot be made.
+  bool lay(std::span<std::byte> message, Regions regions) noexcept;
+  std::span<const iovec> parts() const noexcept { return std::span(parts_).first(partCount_); }
+  std::span<const int> descriptors() const noexcept {
+    return std::span(descriptors_).first(descriptorCount_);
+  }
+
+ private:
+  std::array<iovec, 1 + 2 * kMostRegions> parts_;
+  std::size_t partCount_ = 0;
+  std::array<UniqueFd, kMostRegions> memories_;
+  std::array<int, kMostRegions> descriptors_{};
+  std::size_t descriptorCount_ = 0;
+};
+
+// For sending, which only reads.
+inline iovec iovecOf(std::span<const std::byte> bytes) noexcept {
+  return {const_cast<std::byte*>(bytes.data()), bytes.size()};
+}
+
+}  // namespace brenvik::client

@@ -1,0 +1,43 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <array>
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+
+#include "client/include/brenvik/mobile_helper.h"
+
+namespace brenvik::client {
+
+// Which location requests of a client are still to be answered by a push. A push does not name its request,
+// so it can be told only while there is one of its kind.
+class Questions {
+ public:
+  using Time = std::chrono::steady_clock::time_point;
+  // A push comes within about five seconds; twice that allows for a busy helper.
+  static constexpr std::chrono::seconds kAnswerTime{10};
+
+  // For other routines than the two location requests it does nothing. Number 0: a blocking call.
+  void asked(std::int32_t routine, bvmh_call number, Time now) noexcept;
+  // The helper refused the request.
+  void refused(std::int32_t routine, bvmh_call number) noexcept;
+  // Result as bvmh_match_push.
+  std::int32_t answered(bvmh_event_kind push, Time now, bvmh_call* number) noexcept;
+
+ private:
+  struct Question {
+    bool isOpen = false;
+    bvmh_call number = 0;
+    Time time{};
+  };
+  // The newest two of each kind: more than one is as good as many.
+  using Kind = std::array<Question, 2>;
+
+  Kind* kindOf(std::int32_t routine) noexcept;
+
+  std::array<Kind, 2> kinds_;
+};
+
+}  // namespace brenvik::client
