@@ -158,14 +158,14 @@ class LoadedWebModule::LazyWebClient final : public WebClient {
 class LoadedWebModule::LazyGunzip final : public Gunzip {
  public:
   explicit LazyGunzip(Module& module) : module_(module) {}
-  GunzipResult gunzip(std::span<const std::byte> input, std::uint64_t largestOutput,
-                      const Receiver& receiver) noexcept override {
+  GunzipOutcome gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
+                           std::uint64_t largestOutput) noexcept override {
     std::shared_ptr<Gunzip> gunzip;
     try {
       gunzip = module_.gunzip();
     } catch (...) {  // out of memory
     }
-    return gunzip != nullptr ? gunzip->gunzip(input, largestOutput, receiver) : GunzipResult::unavailable;
+    return gunzip != nullptr ? gunzip->gunzipInto(input, file, room, largestOutput) : GunzipOutcome();
   }
 
  private:

@@ -3,6 +3,7 @@
 #include "platform/web/linux/LoadedWebModule.h"
 
 #include <gtest/gtest.h>
+#include <sys/mman.h>
 #include <sys/resource.h>
 #include <unistd.h>
 
@@ -39,11 +40,11 @@ class LoadedWebModuleTest : public testing::Test {
   }
   GunzipResult unpackHello(LoadedWebModule& module) {
     unpacked.clear();
-    return module.gunzip().gunzip(
-        std::as_bytes(std::span(kHello)), 100, [this](std::span<const std::byte> piece) {
-          unpacked.append(reinterpret_cast<const char*>(piece.data()), piece.size());
-          return true;
-        });
+    const auto outcome = module.gunzip().gunzipInto({std::as_bytes(std::span(kHello))}, file.get(), 100, 100);
+    unpacked.resize(100);
+    unpacked.resize(static_cast<std::size_t>(::pread(file.get(), unpacked.data(), unpacked.size(), 0)));
+    (void)::lseek(file.get(), 0, SEEK_SET);
+    return outcome.result;
   }
 
   // Exits with 7 when the module cannot be had without descriptors, and can be had with them.
@@ -66,6 +67,7 @@ class LoadedWebModuleTest : public testing::Test {
   std::shared_ptr<WorkQueue> callbackQueue = queues.makeSerial("callbacks", QualityOfService::standard);
   RecordingLog log;
   std::string unpacked;
+  UniqueFd file{::memfd_create("gunzip", MFD_CLOEXEC)};
 };
 
 TEST_F(LoadedWebModuleTest, TheBuiltModuleGivesTheClientAndGunzip) {
