@@ -177,7 +177,7 @@ bool HttpFetcher::uncompressInto(int file, const std::string& path) {
   const std::uint64_t reserve = diskReserve(disk.size);
   const std::uint64_t room = disk.available > reserve ? disk.available - reserve : 0;
   const auto [result, need, writeError] =
-      parts_.gunzip.gunzipInto({body_}, file, room, room + kMostCountedBeyondRoom);
+      parts_.gunzip.gunzipInto({body_, body_.sealedMemory()}, file, room, room + kMostCountedBeyondRoom);
   if (result == GunzipResult::refused) {
     errno = writeError;
     tellWriteError(path);

@@ -5,6 +5,7 @@
 #include <cstring>
 #include <limits>
 #include <string_view>
+#include <utility>
 
 #include "platform/network/ErrorNumbers.h"
 #include "platform/worker/WorkerFields.h"
@@ -16,7 +17,8 @@ std::vector<std::byte> encodeName(const char* name) { return FieldWriter().text(
 std::optional<std::string> decodeName(std::span<const std::byte> payload) {
   FieldReader from(payload);
   const std::string name(from.text());
-  if (!from.whole() || name.size() > kLongestName || name.find('\0') != std::string::npos) return std::nullopt;
+  if (!from.whole() || name.size() > kLongestName || name.find('\0') != std::string::npos)
+    return std::nullopt;
   return name;
 }
 
@@ -30,7 +32,7 @@ std::optional<std::optional<std::uint32_t>> decodeNumber(std::span<const std::by
   FieldReader from(payload);
   const auto number = from.optional([](FieldReader& reader) { return reader.u32(); });
   if (!from.whole()) return std::nullopt;
-  return std::optional(number);
+  return std::optional<std::optional<std::uint32_t>>(std::in_place, number);
 }
 
 std::vector<std::byte> encodeSocket(int protocol, std::uint16_t identifier) {
@@ -41,7 +43,8 @@ std::optional<EchoSocketQuestion> decodeSocket(std::span<const std::byte> payloa
   FieldReader from(payload);
   const auto protocol = from.u32();
   const auto identifier = from.u32();
-  if (!from.whole() || protocol > 255 || identifier > std::numeric_limits<std::uint16_t>::max()) return std::nullopt;
+  if (!from.whole() || protocol > 255 || identifier > std::numeric_limits<std::uint16_t>::max())
+    return std::nullopt;
   return EchoSocketQuestion{static_cast<int>(protocol), static_cast<std::uint16_t>(identifier)};
 }
 
@@ -70,7 +73,11 @@ std::optional<EchoSendQuestion> decodeSend(std::span<const std::byte> payload) {
 }
 
 std::vector<std::byte> encodeTransfer(const EchoTransfer& transfer, std::span<const std::byte> bytes) {
-  return FieldWriter().i64(transfer.count).u32(static_cast<std::uint32_t>(transfer.error)).bytes(bytes).take();
+  return FieldWriter()
+      .i64(transfer.count)
+      .u32(static_cast<std::uint32_t>(transfer.error))
+      .bytes(bytes)
+      .take();
 }
 
 std::optional<EchoAnswer> decodeTransfer(std::span<const std::byte> payload, std::size_t largest) {

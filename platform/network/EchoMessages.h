@@ -24,8 +24,8 @@ struct EchoAnswer {
 };
 enum class EchoSocketForm : std::uint8_t { none = 0, withoutIpHeader = 1, withIpHeader = 2 };
 
-// Each has one field or few; a reader gives nothing when they are not all there and no more, or when no correct
-// program sends them. All throw std::bad_alloc.
+// Each has one field or few; a reader gives nothing when they are not all there and no more, or when no
+// correct program sends them. All throw std::bad_alloc.
 std::vector<std::byte> encodeName(const char* name);
 std::optional<std::string> decodeName(std::span<const std::byte> payload);
 std::vector<std::byte> encodeNumber(std::optional<std::uint32_t> number);

@@ -22,7 +22,8 @@ bool isText(std::string_view text) noexcept {
 }
 
 bool isCountryCode(std::string_view code) noexcept {
-  return code.size() == 2 && std::all_of(code.begin(), code.end(), [](char c) { return c >= 'A' && c <= 'Z'; });
+  return code.size() == 2 &&
+         std::all_of(code.begin(), code.end(), [](char c) { return c >= 'A' && c <= 'Z'; });
 }
 
 bool isIpAddress(const std::string& text) noexcept {
@@ -77,10 +78,10 @@ StructuredAddress readAddress(FieldReader& from) {
 enum class Holds : std::uint8_t { nothing = 0, place = 1, address = 2, parts = 3 };
 
 void write(FieldWriter& to, const std::optional<MapItem>& item) {
-  const auto holds = !item                              ? Holds::nothing
-                     : !item->address                   ? Holds::place
+  const auto holds = !item                               ? Holds::nothing
+                     : !item->address                    ? Holds::place
                      : !item->address->structuredAddress ? Holds::address
-                                                        : Holds::parts;
+                                                         : Holds::parts;
   to.u8(static_cast<std::uint8_t>(holds)).boolean(item && item->valid);
   if (holds == Holds::parts) write(to, *item->address->structuredAddress);
 }

@@ -12,8 +12,8 @@
 
 namespace brenvik {
 
-// One gzip file to be unpacked, as it goes to the worker: beside it travel the sealed memory that it lies in and
-// the file to write to.
+// One gzip file to be unpacked, as it goes to the worker: beside it travel the sealed memory that it lies in
+// and the file to write to.
 struct GunzipQuestion {
   std::uint64_t inputSize = 0;
   std::uint64_t room = 0;

@@ -5,13 +5,12 @@
 #include <chrono>
 #include <cstdint>
 
-// What the helper and its network worker agree on: the sorts of work, one a channel, and the kinds of messages on
-// such a channel. Both programs come from one build.
+// What the helper and its network worker agree on: the sorts of work, one a channel, and the kinds of
+// messages on such a channel. Both programs come from one build.
 namespace brenvik {
 
-// The worker's named service in the bootstrap directory, and its program.
+// The worker's named service in the bootstrap directory.
 inline constexpr const char kNetworkWorkerService[] = "com.norvale.brenvik.mobile-helper.network";
-inline constexpr const char kNetworkWorkerProgram[] = "brenvik-network-worker";
 
 enum class NetworkWork : std::uint32_t {
   web = 1,             // one HTTP request
@@ -21,9 +20,9 @@ enum class NetworkWork : std::uint32_t {
   echo = 5,            // look-ups and one echo socket: a question and its answer at a time
 };
 
-// On a channel of any work but `echo`: the helper asks once; the worker says now and then that it is at work, and
-// answers once, or says that it has no memory, thread or room for this one. A channel that hangs up without either
-// is that of a worker that is gone.
+// On a channel of any work but `echo`: the helper asks once; the worker says now and then that it is at work,
+// and answers once, or says that it has no memory, thread or room for this one. A channel that hangs up
+// without either is that of a worker that is gone.
 enum class NetworkMessage : std::uint32_t { ask = 1, alive = 2, answer = 3, refusal = 4 };
 
 // How often a worker says that it is at work, and how long it may say nothing before it counts as hung.

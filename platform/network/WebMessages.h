@@ -32,8 +32,9 @@ struct WebAnswer {
   std::uint64_t bodySize = 0;
 };
 
-// Nothing when it is not such a question or answer, or one that no correct program sends: of a body larger than
-// `largestBody`, or beside a failure; of texts with NUL bytes or line breaks in them. All throw std::bad_alloc.
+// Nothing when it is not such a question or answer, or one that no correct program sends: of a body larger
+// than `largestBody`, or beside a failure; of texts with NUL bytes or line breaks in them. All throw
+// std::bad_alloc.
 std::vector<std::byte> encode(const WebQuestion& question);
 std::optional<WebQuestion> decodeWebQuestion(std::span<const std::byte> payload);
 std::vector<std::byte> encode(const WebAnswer& answer);

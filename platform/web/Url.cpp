@@ -22,7 +22,8 @@ bool isPort(std::string_view text) noexcept {
 // An IPv6 address with or without a zone; which one it is, the client finds out.
 bool isBracketed(std::string_view host) noexcept {
   const auto address = host.substr(0, host.find('%'));
-  return !address.empty() && address.find_first_not_of("0123456789abcdefABCDEF:.") == std::string_view::npos &&
+  return !address.empty() &&
+         address.find_first_not_of("0123456789abcdefABCDEF:.") == std::string_view::npos &&
          address.find(':') != std::string_view::npos;
 }
 
@@ -53,7 +54,8 @@ bool isUsableUrl(std::string_view url) noexcept {
     const auto end = std::min(host.find(':'), host.size());
     port = host.substr(end);
     host = host.substr(0, end);
-    if (host.empty() || host.find_first_of("!{}[]\\$'\"^`*<>=;,+&()|") != std::string_view::npos) return false;
+    if (host.empty() || host.find_first_of("!{}[]\\$'\"^`*<>=;,+&()|") != std::string_view::npos)
+      return false;
   }
   return port.empty() || isPort(port.substr(1));
 }

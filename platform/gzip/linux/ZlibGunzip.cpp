@@ -77,12 +77,18 @@ GunzipResult ZlibGunzip::gunzip(std::span<const std::byte> input, std::uint64_t 
 }
 
 GunzipOutcome ZlibGunzip::gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
-                                     std::uint64_t largestOutput) noexcept try {
+                                     std::uint64_t largestOutput) noexcept {
+  return gunzipInto(input, file, room, largestOutput, nullptr);
+}
+
+GunzipOutcome ZlibGunzip::gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
+                                     std::uint64_t largestOutput,
+                                     const std::function<bool()>& mayGoOn) noexcept try {
   GunzipOutcome outcome;
   outcome.result = gunzip(input.bytes, largestOutput, [&](std::span<const std::byte> output) {
     outcome.size += output.size();
     if (outcome.size <= room) outcome.writeError = writeAll(file, output);
-    return outcome.writeError == 0;
+    return outcome.writeError == 0 && (!mayGoOn || mayGoOn());
   });
   return outcome;
 } catch (...) {

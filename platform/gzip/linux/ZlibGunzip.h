@@ -20,6 +20,9 @@ class ZlibGunzip final : public Gunzip {
                       const Receiver& receiver) noexcept;
   GunzipOutcome gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
                            std::uint64_t largestOutput) noexcept override;
+  // The same; `mayGoOn` is asked after each piece.
+  GunzipOutcome gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
+                           std::uint64_t largestOutput, const std::function<bool()>& mayGoOn) noexcept;
 };
 
 }  // namespace brenvik

@@ -29,7 +29,8 @@ UniqueFd sealedCopy(std::span<const std::byte> bytes) {
 
 }  // namespace
 
-WorkerMessage packLarge(std::uint32_t kind, std::vector<std::byte> payload, std::vector<UniqueFd> descriptors) {
+WorkerMessage packLarge(std::uint32_t kind, std::vector<std::byte> payload,
+                        std::vector<UniqueFd> descriptors) {
   WorkerMessage message{kind, {}, std::move(descriptors)};
   if (payload.size() < WorkerMessage::kLongestPayload) {
     payload.insert(payload.begin(), static_cast<std::byte>(Travels::here));

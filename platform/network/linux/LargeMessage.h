@@ -13,13 +13,14 @@
 
 namespace brenvik {
 
-// The longest payload of a message that need not fit a datagram: an answer's header fields have 256 KiB, and an
-// address with every part as long as it may be stays below, too.
+// The longest payload of a message that need not fit a datagram: an answer's header fields have 256 KiB, and
+// an address with every part as long as it may be stays below, too.
 inline constexpr std::size_t kLongestLargePayload = std::size_t{1} << 20;
 
-// A message whose payload travels in sealed memory where it is too long for a datagram. Throws std::bad_alloc,
-// also where there are no descriptors.
-WorkerMessage packLarge(std::uint32_t kind, std::vector<std::byte> payload, std::vector<UniqueFd> descriptors = {});
+// A message whose payload travels in sealed memory where it is too long for a datagram. Throws
+// std::bad_alloc, also where there are no descriptors.
+WorkerMessage packLarge(std::uint32_t kind, std::vector<std::byte> payload,
+                        std::vector<UniqueFd> descriptors = {});
 
 // What packLarge() made, read again; the descriptors are the message's others.
 class LargePayload {

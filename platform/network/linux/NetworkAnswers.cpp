@@ -67,6 +67,16 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
     tell(*question, why, nullptr);
   }
 
+  void cancel(const std::shared_ptr<const void>& question) noexcept {
+    const std::lock_guard lock(mutex_);
+    if (queue_ == nullptr) return;
+    try {
+      queue_->post([self = shared_from_this(), question] { self->abandon(question.get()); });
+    } catch (const std::bad_alloc&) {
+      // It goes on to its own limit.
+    }
+  }
+
   void shutDown() noexcept {
     std::shared_ptr<WorkQueue> queue;
     bool used = false;
@@ -97,8 +107,9 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
     std::shared_ptr<Question> question;
     WorkerChannel channel;
     Clock::time_point deadline;
-    Clock::time_point heard;  // when the worker last said something; on a clock that stands while the system sleeps
-    int signsOfLife = 0;      // since the timer fired last
+    Clock::time_point
+        heard;  // when the worker last said something; on a clock that stands while the system sleeps
+    int signsOfLife = 0;  // since the timer fired last
     std::unique_ptr<DescriptorSource> source;
     std::unique_ptr<WorkQueue::Timer> timer;
   };
@@ -142,7 +153,8 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
       at->deadline = at->heard + question->limit;
       const auto interval = std::min(question->limit, longestSilence_ / 2);
       at->timer = loop_->makeTimer(interval, interval, kTimerLeeway, [this, at] { passed(at); });
-      at->source = loop_->watchDescriptor(at->channel.descriptor(), EPOLLIN, [this, at](std::uint32_t) { read(at); });
+      at->source =
+          loop_->watchDescriptor(at->channel.descriptor(), EPOLLIN, [this, at](std::uint32_t) { read(at); });
       if (at->timer != nullptr && at->timer->activate() && at->source != nullptr) return;
     } catch (const std::bad_alloc&) {  // as below
     }
@@ -208,6 +220,21 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
     admitting_ = false;
   }
 
+  void abandon(const void* question) noexcept {
+    for (auto at = exchanges_.begin(); at != exchanges_.end(); ++at) {
+      if (at->question.get() == question) return end(at, Ended::cancelled, nullptr);
+    }
+    for (auto& line : lines_) {
+      const auto found = std::find_if(line.waiting.begin(), line.waiting.end(),
+                                      [&](const auto& each) { return each.get() == question; });
+      if (found == line.waiting.end()) continue;
+      const auto abandoned = std::move(*found);
+      line.waiting.erase(found);
+      tell(*abandoned, Ended::cancelled, nullptr);
+      return;
+    }
+  }
+
   void abandonAll() noexcept {
     for (auto& line : lines_) {
       const auto waiting = std::exchange(line.waiting, {});
@@ -235,7 +262,8 @@ NetworkAnswers::NetworkAnswers(WorkQueues& queues, Worker& worker, milliseconds 
 
 NetworkAnswers::~NetworkAnswers() { shutDown(); }
 
-void NetworkAnswers::ask(NetworkWork work, WorkerMessage question, milliseconds limit, Handler handler) noexcept {
+NetworkAnswers::Token NetworkAnswers::ask(NetworkWork work, WorkerMessage question, milliseconds limit,
+                                          Handler handler) noexcept {
   std::shared_ptr<Question> made;
   try {
     made = std::make_shared<Question>();
@@ -244,10 +272,16 @@ void NetworkAnswers::ask(NetworkWork work, WorkerMessage question, milliseconds 
       if (handler) (void)handler(Ended::refused, nullptr);
     } catch (const std::bad_alloc&) {  // whoever asked has a time-out
     }
-    return;
+    return {};
   }
   *made = {work, std::move(question), limit, std::move(handler)};
+  Token token = made;
   desk_->ask(std::move(made));
+  return token;
+}
+
+void NetworkAnswers::cancel(const Token& token) noexcept {
+  if (const auto question = token.lock()) desk_->cancel(question);
 }
 
 void NetworkAnswers::shutDown() noexcept { desk_->shutDown(); }

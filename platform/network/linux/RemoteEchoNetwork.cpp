@@ -60,8 +60,8 @@ class Conversation {
 
 // One look-up, in a conversation of its own.
 template <typename Decode>
-auto lookUp(Worker& worker, EchoMessageKind kind, const char* name, milliseconds patience, Decode decode) noexcept
-    -> decltype(decode(std::span<const std::byte>())) {
+auto lookUp(Worker& worker, EchoMessageKind kind, const char* name, milliseconds patience,
+            Decode decode) noexcept -> decltype(decode(std::span<const std::byte>())) {
   try {
     if (std::strlen(name) > kLongestName) return {};
     return Conversation(worker).ask(kind, encodeName(name), patience, decode);
@@ -85,8 +85,9 @@ class RemoteEchoNetwork::Socket final : public EchoSocket {
   int setReceiveTimeOut(std::chrono::microseconds timeOut) noexcept override try {
     // Zero would be for ever.
     const auto microseconds = std::clamp<std::int64_t>(timeOut.count(), 1, UINT32_MAX);
-    const auto error = conversation_.ask(EchoMessageKind::setReceiveTimeOut,
-                                         encodeNumber(static_cast<std::uint32_t>(microseconds)), patience_, decodeNumber);
+    const auto error =
+        conversation_.ask(EchoMessageKind::setReceiveTimeOut,
+                          encodeNumber(static_cast<std::uint32_t>(microseconds)), patience_, decodeNumber);
     if (!error || !*error || **error > kLargestError) return EPIPE;
     timeOut_ = std::chrono::ceil<milliseconds>(std::chrono::microseconds(microseconds));
     return static_cast<int>(**error);
@@ -112,7 +113,8 @@ class RemoteEchoNetwork::Socket final : public EchoSocket {
         [&](std::span<const std::byte> payload) { return decodeTransfer(payload, largest); });
     if (!answer) return {-1, EPIPE};
     if (answer->transfer.count >= 0) std::copy(answer->bytes.begin(), answer->bytes.end(), buffer.begin());
-    return {answer->transfer.count < 0 ? -1 : static_cast<std::ptrdiff_t>(answer->bytes.size()), answer->transfer.error};
+    return {answer->transfer.count < 0 ? -1 : static_cast<std::ptrdiff_t>(answer->bytes.size()),
+            answer->transfer.error};
   } catch (const std::bad_alloc&) {
     return {-1, ENOMEM};
   }
@@ -155,10 +157,11 @@ unsigned RemoteEchoNetwork::indexOfInterface(const char* name) noexcept {
   return number ? number->value_or(0) : 0;
 }
 
-std::unique_ptr<EchoSocket> RemoteEchoNetwork::openEchoSocket(int protocol, std::uint16_t identifier) noexcept try {
+std::unique_ptr<EchoSocket> RemoteEchoNetwork::openEchoSocket(int protocol, std::uint16_t identifier) noexcept
+    try {
   Conversation conversation(worker_);
-  const auto form =
-      conversation.ask(EchoMessageKind::openSocket, encodeSocket(protocol, identifier), patience_, decodeForm);
+  const auto form = conversation.ask(EchoMessageKind::openSocket, encodeSocket(protocol, identifier),
+                                     patience_, decodeForm);
   if (!form || *form == EchoSocketForm::none) return nullptr;
   return std::make_unique<Socket>(std::move(conversation), *form, patience_);
 } catch (const std::bad_alloc&) {

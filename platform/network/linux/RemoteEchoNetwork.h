@@ -9,12 +9,12 @@
 
 namespace brenvik {
 
-// The network of a prober, in the network worker; the clocks are this process's. The caller's thread waits for each
-// answer, but not for a worker that has died or hangs: what it asks then fails.
+// The network of a prober, in the network worker; the clocks are this process's. The caller's thread waits
+// for each answer, but not for a worker that has died or hangs: what it asks then fails.
 class RemoteEchoNetwork final : public EchoNetwork {
  public:
-  // How long an answer that takes no time may take, the worker's start included; and beyond its own time-out one that
-  // does.
+  // How long an answer that takes no time may take, the worker's start included; and beyond its own time-out
+  // one that does.
   static constexpr std::chrono::milliseconds kPatience = std::chrono::seconds(3);
   // A name server that does not answer is given up by the C library after ten seconds.
   static constexpr std::chrono::milliseconds kLookUpPatience = std::chrono::seconds(12);

@@ -12,8 +12,8 @@
 namespace brenvik {
 namespace {
 
-// Four seconds until its turn and ten for a server, or eight for a STUN transaction; and as much again as a busy
-// machine may need.
+// Four seconds until its turn and ten for a server, or eight for a STUN transaction; and as much again as a
+// busy machine may need.
 constexpr std::chrono::seconds kLongestLookUp{20};
 
 constexpr const char* kNoWorker = "the network worker is not available";
@@ -29,9 +29,9 @@ void answerOn(const std::weak_ptr<WorkQueue>& queue, const Handler& handler, Geo
 
 // What the worker's answer comes to; `makesSense` is false of one that it should not give.
 template <typename Answer, typename Decode>
-GeoOutcome<Answer> outcomeOf(NetworkAnswers::Ended ended, WorkerMessage* answer, Decode decode, bool& makesSense) {
-  if (answer == nullptr)
-    return {{}, GeoError{ended == NetworkAnswers::Ended::refused ? kNoRoom : kNoWorker}};
+GeoOutcome<Answer> outcomeOf(NetworkAnswers::Ended ended, WorkerMessage* answer, Decode decode,
+                             bool& makesSense) {
+  if (answer == nullptr) return {{}, GeoError{ended == NetworkAnswers::Ended::refused ? kNoRoom : kNoWorker}};
   const auto opened = LargePayload::open(std::move(*answer));
   if (opened) {
     if (auto outcome = decode(opened->bytes())) return *std::move(outcome);
@@ -48,20 +48,20 @@ WorkerMessage askWith(std::vector<std::byte> payload) {
 
 class RemoteGeoService::ReverseTicket final : public ReverseGeocodeTicket {
  public:
-  ReverseTicket(RemoteGeoService& service, Coordinate coordinate) : service_(service), coordinate_(coordinate) {}
+  ReverseTicket(RemoteGeoService& service, Coordinate coordinate)
+      : service_(service), coordinate_(coordinate) {}
   void submit(ReverseGeocodeHandler handler, const GeoNetworkActivity*,
               const std::shared_ptr<WorkQueue>& handlerQueue) override {
-    service_.answers_.ask(
-        NetworkWork::reverseGeocode, askWith(encode(coordinate_)), kLongestLookUp,
-        [handler = std::move(handler), queue = std::weak_ptr(handlerQueue), country = service_.country_](
-            NetworkAnswers::Ended ended, WorkerMessage* answer) {
-          if (ended == NetworkAnswers::Ended::cancelled) return true;
-          bool makesSense = true;
-          auto outcome = outcomeOf<MapItems>(ended, answer, decodeMapItems, makesSense);
-          if (const auto code = countryIn(outcome)) country->setLastGeocoded(*code);
-          answerOn(queue, handler, std::move(outcome));
-          return makesSense;
-        });
+    service_.answers_.ask(NetworkWork::reverseGeocode, askWith(encode(coordinate_)), kLongestLookUp,
+                          [handler = std::move(handler), queue = std::weak_ptr(handlerQueue),
+                           country = service_.country_](NetworkAnswers::Ended ended, WorkerMessage* answer) {
+                            if (ended == NetworkAnswers::Ended::cancelled) return true;
+                            bool makesSense = true;
+                            auto outcome = outcomeOf<MapItems>(ended, answer, decodeMapItems, makesSense);
+                            if (const auto code = countryIn(outcome)) country->setLastGeocoded(*code);
+                            answerOn(queue, handler, std::move(outcome));
+                            return makesSense;
+                          });
   }
 
  private:
@@ -82,16 +82,18 @@ class RemoteGeoService::IpTicket final : public GeoIpTicket {
               const std::shared_ptr<WorkQueue>& handlerQueue) override {
     const std::weak_ptr queue(handlerQueue);
     if (!ofThisDevice_) {
-      return answerOn(queue, handler,
-                      GeoOutcome<GeoIpResult>{{}, GeoError{"only this device's own address can be looked up"}});
+      return answerOn(
+          queue, handler,
+          GeoOutcome<GeoIpResult>{{}, GeoError{"only this device's own address can be looked up"}});
     }
-    service_.answers_.ask(NetworkWork::publicAddress, askWith({}), kLongestLookUp,
-                          [handler = std::move(handler), queue](NetworkAnswers::Ended ended, WorkerMessage* answer) {
-                            if (ended == NetworkAnswers::Ended::cancelled) return true;
-                            bool makesSense = true;
-                            answerOn(queue, handler, outcomeOf<GeoIpResult>(ended, answer, decodeGeoIpResult, makesSense));
-                            return makesSense;
-                          });
+    service_.answers_.ask(
+        NetworkWork::publicAddress, askWith({}), kLongestLookUp,
+        [handler = std::move(handler), queue](NetworkAnswers::Ended ended, WorkerMessage* answer) {
+          if (ended == NetworkAnswers::Ended::cancelled) return true;
+          bool makesSense = true;
+          answerOn(queue, handler, outcomeOf<GeoIpResult>(ended, answer, decodeGeoIpResult, makesSense));
+          return makesSense;
+        });
   }
 
  private:
@@ -102,8 +104,9 @@ class RemoteGeoService::IpTicket final : public GeoIpTicket {
 RemoteGeoService::RemoteGeoService(NetworkAnswers& answers, CountryConfiguration::Files countryFiles)
     : answers_(answers), country_(std::make_shared<CountryConfiguration>(std::move(countryFiles))) {}
 
-std::unique_ptr<ReverseGeocodeTicket> RemoteGeoService::makeReverseGeocodeTicket(Coordinate coordinate, IncludeEta,
-                                                                                 ShiftLocations, const GeoTraits*) {
+std::unique_ptr<ReverseGeocodeTicket> RemoteGeoService::makeReverseGeocodeTicket(Coordinate coordinate,
+                                                                                 IncludeEta, ShiftLocations,
+                                                                                 const GeoTraits*) {
   // No route is planned here, and no source has coordinates that would have to be shifted.
   return std::make_unique<ReverseTicket>(*this, coordinate);
 }

@@ -12,8 +12,8 @@
 
 namespace brenvik {
 
-// The geo service, in the network worker; the country configuration, and the country of the last answer, are kept
-// here. A question to which the worker gives no answer ends in an error.
+// The geo service, in the network worker; the country configuration, and the country of the last answer, are
+// kept here. A question to which the worker gives no answer ends in an error.
 class RemoteGeoService final : public GeoService {
  public:
   // The answers outlive it, or have been shut down. Cheap: opens nothing.

@@ -76,9 +76,11 @@ GunzipOutcome RemoteGunzip::gunzipInto(const GunzipInput& input, int file, std::
     result = channel.receive(&answer, Clock::now());
     if (result == WorkerResult::outOfMemory) return {GunzipResult::outOfMemory, 0, 0};
     if (result != WorkerResult::done) break;
-    if (answer.kind == static_cast<std::uint32_t>(NetworkMessage::refusal)) return {GunzipResult::outOfMemory, 0, 0};
+    if (answer.kind == static_cast<std::uint32_t>(NetworkMessage::refusal))
+      return {GunzipResult::outOfMemory, 0, 0};
     if (answer.kind == static_cast<std::uint32_t>(NetworkMessage::answer)) {
-      if (const auto outcome = decodeGunzipOutcome(answer.payload, question); outcome && answer.descriptors.empty())
+      if (const auto outcome = decodeGunzipOutcome(answer.payload, question);
+          outcome && answer.descriptors.empty())
         return *outcome;
       break;
     }

@@ -11,8 +11,8 @@
 
 namespace brenvik {
 
-// Gunzip, in the network worker, which is handed the file. The caller's thread waits, as long as the worker says
-// now and then that it is at work.
+// Gunzip, in the network worker, which is handed the file. The caller's thread waits, as long as the worker
+// says now and then that it is at work.
 class RemoteGunzip final : public Gunzip {
  public:
   // The worker outlives it.

@@ -19,6 +19,11 @@ using std::chrono::milliseconds;
 // What the worker may take beyond the limit that it has itself.
 constexpr milliseconds kAllowance = std::chrono::minutes(1);
 
+// The client's own limit, as the seam has it: a minute, and a second for each 64 KiB of the largest body.
+milliseconds longestOf(std::uint64_t largestBody) noexcept {
+  return std::chrono::minutes(1) + std::chrono::seconds(largestBody >> 16);
+}
+
 WebErrorKind kindOf(NetworkAnswers::Ended ended) noexcept {
   switch (ended) {
     case NetworkAnswers::Ended::answered:
@@ -67,7 +72,9 @@ class RemoteWebClient::Request final : public WebRequest {
   void setCompletion(Completion completion) override {
     completion_ = std::make_shared<Completion>(std::move(completion));
   }
-  void setTimeLimit(milliseconds limit) noexcept override { question_.timeLimit = std::max(limit, milliseconds(0)); }
+  void setTimeLimit(milliseconds limit) noexcept override {
+    question_.timeLimit = std::max(limit, milliseconds(0));
+  }
   void setLargestBody(std::uint64_t bytes) noexcept override {
     question_.largestBody = std::min(bytes, kLargestWebBody);
   }
@@ -82,9 +89,12 @@ class RemoteWebClient::Request final : public WebRequest {
     ticket->completion = std::exchange(completion_, nullptr);
     auto limit = longestOf(question_.largestBody);
     if (question_.timeLimit > milliseconds(0)) limit = std::min(limit, question_.timeLimit);
-    answers_.ask(NetworkWork::web, std::move(message), limit + kAllowance,
-                 [ticket](NetworkAnswers::Ended ended, WorkerMessage* answer) { return ticket->end(ended, answer); });
+    token_ = answers_.ask(
+        NetworkWork::web, std::move(message), limit + kAllowance,
+        [ticket](NetworkAnswers::Ended ended, WorkerMessage* answer) { return ticket->end(ended, answer); });
   }
+
+  void cancel() noexcept override { answers_.cancel(token_); }
 
  private:
   // What telling the outcome takes, made beforehand: it takes no memory then.
@@ -123,6 +133,7 @@ class RemoteWebClient::Request final : public WebRequest {
   WebQuestion question_;
   std::shared_ptr<WorkQueue> queue_;
   std::shared_ptr<Completion> completion_;
+  NetworkAnswers::Token token_;
 };
 
 std::shared_ptr<WebSession> RemoteWebClient::makeSession() { return std::make_shared<Session>(); }
@@ -135,7 +146,8 @@ std::shared_ptr<WebRequest> RemoteWebClient::makeRequest(WebRequestType type, co
   question.url = url;
   for (const auto& [name, value] : headers) {
     // Nobody should see a field of his break out of its line, in a message either.
-    if (name.empty() || (name + value).find_first_of(std::string_view("\r\n\0", 3)) != std::string::npos) continue;
+    if (name.empty() || (name + value).find_first_of(std::string_view("\r\n\0", 3)) != std::string::npos)
+      continue;
     question.headers.emplace(name, value);
   }
   return std::make_shared<Request>(answers_, std::static_pointer_cast<Session>(session), std::move(question));

@@ -21,7 +21,8 @@ class RemoteWebClient final : public WebClient {
   explicit RemoteWebClient(NetworkAnswers& answers) noexcept : answers_(answers) {}
 
   std::shared_ptr<WebSession> makeSession() override;
-  std::shared_ptr<WebRequest> makeRequest(WebRequestType type, const std::string& url, const HeaderMap& headers,
+  std::shared_ptr<WebRequest> makeRequest(WebRequestType type, const std::string& url,
+                                          const HeaderMap& headers,
                                           std::shared_ptr<WebSession> session) override;
 
  private:

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/geo/linux/CountryConfiguration.h"
+#include "platform/geo/country/CountryConfiguration.h"
 
 #include <gtest/gtest.h>
 #include <sys/resource.h>
