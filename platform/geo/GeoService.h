@@ -76,8 +76,8 @@ class GeoIpTicket {
                       const std::shared_ptr<WorkQueue>& handlerQueue) = 0;
 };
 
-// Looks things up for whoever asks. Any thread. It must outlive its tickets; answers that are under way when it is
-// destroyed are dropped.
+// Looks things up for whoever asks. Any thread. It must outlive its tickets; answers that are under way when
+// it is destroyed are dropped.
 class GeoTickets {
  public:
   virtual ~GeoTickets() = default;
