@@ -4,12 +4,8 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <cerrno>
-#include <cstdio>
-#include <cstdlib>
-#include <memory>
 #include <new>
 
 #include "platform/base/ErrorText.h"
@@ -17,6 +13,7 @@
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/sqlite/ForeignDatabase.h"
+#include "platform/sqlite/HeldFolder.h"
 
 namespace brenvik {
 namespace {
@@ -25,7 +22,6 @@ namespace {
 constexpr int kMostMovedAside = 100;
 
 constexpr const char* kFile = "voicemail.db";
-constexpr const char* kFolderInTheMaking = ".brenvik-folder";
 
 constexpr const char* kSchema =
     "CREATE TABLE IF NOT EXISTS general(id INTEGER PRIMARY KEY CHECK(id = 0), token TEXT NOT NULL);"
@@ -34,29 +30,6 @@ constexpr const char* kSchema =
 bool isDamage(int code) {
   const int primary = code & 0xFF;
   return primary == SQLITE_NOTADB || primary == SQLITE_CORRUPT;
-}
-
-// Makes the directory below another one for the account, unless it is there. Never follows a link: the
-// account's own directories are its user's to rearrange.
-UniqueFd enterDirectory(int parent, const char* name, mode_t mode, uid_t uid, gid_t gid, bool create) {
-  constexpr int kFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-  UniqueFd fd(::openat(parent, name, kFlags));
-  if (fd.isValid() || errno != ENOENT || !create) return fd;
-  // Under another name until it is the account's: killed in between, a helper would leave the account a
-  // folder that it may not enter. One left so is used.
-  if (::mkdirat(parent, kFolderInTheMaking, 0700) != 0 && errno != EEXIST) return {};
-  fd.reset(::openat(parent, kFolderInTheMaking, kFlags));
-  if (!fd.isValid() || ::fchown(fd.get(), uid, gid) != 0 || ::fchmod(fd.get(), mode) != 0 ||
-      ::renameat(parent, kFolderInTheMaking, parent, name) != 0) {
-    (void)::unlinkat(parent, kFolderInTheMaking, AT_REMOVEDIR);  // the next attempt copes with what stays
-    return {};
-  }
-  // Or a power cut takes the folder with the tokens in it. The next attempt makes it again.
-  if (::fsync(parent) != 0) {
-    (void)::unlinkat(parent, name, AT_REMOVEDIR);
-    return {};
-  }
-  return fd;
 }
 
 }  // namespace
@@ -120,42 +93,25 @@ class SqliteVoicemailStore::Database {
 
 // Where the database is.
 struct SqliteVoicemailStore::Place {
-  UniqueFd folder;
-  std::string file;  // its path
+  int folder = -1;
+  std::string file;  // as SQLite finds it
 };
 
-// Makes the folders and the empty file, each with its owner and mode. SQLite refuses a path with a link in
-// it, so links above the home are resolved first.
-SqliteVoicemailStore::Found SqliteVoicemailStore::find(Place* place, IfMissing ifMissing) {
+// Makes the empty file with its mode.
+SqliteVoicemailStore::Found SqliteVoicemailStore::find(Place* place, Purpose purpose) {
   const auto missing = [] { return errno == ENOENT ? Found::nothing : Found::unusable; };
-  const Account account = account_();
-  if (account.home.empty()) return Found::nothing;
-  const std::unique_ptr<char, decltype(&std::free)> home(::realpath(account.home.c_str(), nullptr),
-                                                         &std::free);
-  if (!home && errno == ENOMEM) throw std::bad_alloc();
-  if (!home) return missing();
-  const bool create = ifMissing == IfMissing::create;
-  const UniqueFd top(::open(home.get(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-  if (!top.isValid()) return missing();
-  const UniqueFd library = enterDirectory(top.get(), "Library", 0755, account.uid, account.gid, create);
-  if (!library.isValid()) return missing();
-  place->folder = enterDirectory(library.get(), "Voicemail", 0700, account.uid, account.gid, create);
-  if (!place->folder.isValid()) return missing();
-  const int folder = place->folder.get();
+  place->folder = folder_(purpose);
+  if (place->folder < 0) return missing();
+  const int folder = place->folder;
   UniqueFd database(::openat(folder, kFile, O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-  if (!database.isValid() && errno == ENOENT && create) {
+  if (!database.isValid() && errno == ENOENT && purpose == Purpose::writing) {
     database.reset(::openat(folder, kFile, O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   }
   if (!database.isValid()) return missing();
   struct stat info {};
   if (::fstat(database.get(), &info) != 0 || !S_ISREG(info.st_mode)) return Found::unusable;
-  // The journal takes its owner and mode from the database. Of a name elsewhere nothing is given away.
-  if ((info.st_uid != account.uid || info.st_gid != account.gid) && info.st_nlink == 1 &&
-      ::fchown(database.get(), account.uid, account.gid) != 0) {
-    return Found::unusable;
-  }
   if ((info.st_mode & 07777) != 0600 && ::fchmod(database.get(), 0600) != 0) return Found::unusable;
-  place->file = std::string(home.get()) + "/Library/Voicemail/" + kFile;
+  place->file = pathInHeldFolder(folder, kFile);
   return Found::database;
 }
 
@@ -165,7 +121,7 @@ bool SqliteVoicemailStore::moveAside(const Place& place) {
   for (int number = 0; number < kMostMovedAside; ++number) {
     std::string name = std::string(kFile) + ".damaged";
     if (number > 0) name += "." + std::to_string(number);
-    if (renameToFreeName(place.folder.get(), kFile, name.c_str()) == 0) {
+    if (renameToFreeName(place.folder, kFile, name.c_str()) == 0) {
       logUnified(LogLevel::error, "The voicemail store is damaged; moved aside to %s", name.c_str());
       return true;
     }
@@ -184,7 +140,7 @@ bool SqliteVoicemailStore::write(const char* statement, const std::string* first
     SqliteTimeLimit limit(kPatience, time_);
     for (int attempt = 0; attempt < 2; ++attempt) {
       Place place;
-      if (find(&place, IfMissing::create) != Found::database) break;
+      if (find(&place, Purpose::writing) != Found::database) break;
       {
         Database database;
         code = database.open(place.file, limit);
@@ -206,7 +162,7 @@ bool SqliteVoicemailStore::read(const char* statement, const std::string* key,
   try {
     SqliteTimeLimit limit(kPatience, time_);
     Place place;
-    const Found found = find(&place, IfMissing::fail);
+    const Found found = find(&place, Purpose::reading);
     if (found == Found::nothing) return true;
     if (found == Found::database) {
       Database database;
