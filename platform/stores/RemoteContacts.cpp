@@ -22,8 +22,9 @@ class RemoteManager final : public ContactsChannelManager {
   stores::ContactsOutcome open(const UniqueFd& folder) {
     WorkerMessage message;
     message.kind = stores::kOpenContacts;
-    message.descriptors.emplace_back(::fcntl(folder.get(), F_DUPFD_CLOEXEC, 0));
-    if (!message.descriptors.back().isValid()) return stores::ContactsOutcome::outOfMemory;
+    UniqueFd copy(::fcntl(folder.get(), F_DUPFD_CLOEXEC, 0));
+    if (!copy.isValid()) return stores::ContactsOutcome::outOfMemory;
+    message.descriptors.push_back(std::move(copy));
     WorkerResult result = WorkerResult::closed;
     // A worker that has died since the last request is replaced.
     for (int attempt = 0; attempt < 2 && result == WorkerResult::closed; ++attempt) {

@@ -26,8 +26,9 @@ WorkerResult RemoteVoicemailStore::send(const VoicemailRequest& request, const S
     if (isNew) {
       (void)folder_.prepare(folder);
       message.descriptors.clear();
-      message.descriptors.emplace_back(::fcntl(folder.descriptor.get(), F_DUPFD_CLOEXEC, 0));
-      if (!message.descriptors.back().isValid()) return WorkerResult::outOfMemory;
+      UniqueFd copy(::fcntl(folder.descriptor.get(), F_DUPFD_CLOEXEC, 0));
+      if (!copy.isValid()) return WorkerResult::outOfMemory;
+      message.descriptors.push_back(std::move(copy));
     }
     if (!channel_.isOpen()) {
       const WorkerResult opened =
