@@ -213,7 +213,7 @@ bool compareTokenReads() {
                                   "start");
                         });
                       }}},
-                    {{.ours = 0, .peer = 1, .most = 2.0}});
+                    {{.ours = 0, .peer = 1, .most = 1.25}});
   return isFast && startsAtOnce;
 }
 

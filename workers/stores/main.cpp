@@ -10,6 +10,7 @@
 #include <utility>
 
 #include "platform/log/linux/SystemLog.h"
+#include "platform/sqlite/Sqlite.h"
 #include "platform/stores/StoreMessages.h"
 #include "platform/worker/linux/WorkerHost.h"
 #include "workers/stores/StoreService.h"
@@ -47,6 +48,8 @@ int main() {
   // The same identifier as the helper's: whoever reads its log sees what became of its requests.
   brenvik::SystemLog log("BrenvikMobileHelper");
   brenvik::setLogSink(&log);
+  // Nothing it is asked goes without: the first request finds the library there.
+  (void)brenvik::sqlite();
   const int status = brenvik::WorkerHost::run(
       {.service = brenvik::stores::kService,
        .rights = {.accounts = {"mobile"}, .keptCapabilities = {}, .addressSpace = rlim_t{1} << 30}},

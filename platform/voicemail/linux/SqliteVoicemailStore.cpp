@@ -34,10 +34,23 @@ bool isDamage(int code) {
 
 }  // namespace
 
+// Which file it is, of all that are there now.
+struct SqliteVoicemailStore::Identity {
+  dev_t device = 0;
+  ino_t inode = 0;
+  static Identity of(const struct stat& info) { return {info.st_dev, info.st_ino}; }
+  bool operator==(const Identity&) const = default;
+};
+
 // One opened database.
 class SqliteVoicemailStore::Database {
  public:
-  // SQLITE_OK or SQLite's extended code. The limit outlives the object.
+  UniqueFd folder;  // by which SQLite finds the journal, too
+  // Which folder and which file they are. Nobody else's as long as they are open.
+  Identity folderIs;
+  Identity fileIs;
+
+  // SQLITE_OK or SQLite's extended code.
   int open(const std::string& file, SqliteTimeLimit& limit) {
     bool lackedMemory = false;
     if (sqlite(&lackedMemory) == nullptr) return lackedMemory ? SQLITE_NOMEM : SQLITE_CANTOPEN;
@@ -53,6 +66,22 @@ class SqliteVoicemailStore::Database {
     sqlite()->db_config(opened, SQLITE_DBCONFIG_ENABLE_TRIGGER, 0, nullptr);
     sqlite()->db_config(opened, SQLITE_DBCONFIG_ENABLE_VIEW, 0, nullptr);
     limit.applyTo(opened);
+    const int failed = prepare();
+    SqliteTimeLimit::lift(opened);
+    return failed;
+  }
+
+  // Runs one statement within the limit.
+  int run(SqliteTimeLimit& limit, const char* statement, const std::string* first, const std::string* second,
+          std::optional<std::string>* result) {
+    limit.applyTo(handle_.get());
+    const int code = run(statement, first, second, result);
+    SqliteTimeLimit::lift(handle_.get());
+    return code;
+  }
+
+ private:
+  int prepare() {
     // EXTRA: the folder is synced as well when the journal goes, or a power cut could bring the journal back,
     // and with it the state before a change that was answered.
     const int failed = execute("PRAGMA journal_mode=DELETE; PRAGMA synchronous=EXTRA;");
@@ -63,7 +92,7 @@ class SqliteVoicemailStore::Database {
     return sqlite()->exec(handle_.get(), statements, nullptr, nullptr, nullptr);
   }
 
-  // Runs one statement with up to two texts bound; *result gets the first column of the first row, if any.
+  // With up to two texts bound; *result gets the first column of the first row, if any.
   int run(const char* statement, const std::string* first, const std::string* second,
           std::optional<std::string>* result) {
     sqlite3_stmt* prepared = nullptr;
@@ -87,14 +116,19 @@ class SqliteVoicemailStore::Database {
     return code == SQLITE_ROW || code == SQLITE_DONE ? SQLITE_OK : code;
   }
 
- private:
   SqliteDatabase handle_;
 };
+
+SqliteVoicemailStore::SqliteVoicemailStore(Folder folder, SqliteTime time)
+    : folder_(std::move(folder)), time_(std::move(time)) {}
+
+SqliteVoicemailStore::~SqliteVoicemailStore() = default;
 
 // Where the database is.
 struct SqliteVoicemailStore::Place {
   int folder = -1;
-  std::string file;  // as SQLite finds it
+  Identity folderIs;
+  Identity fileIs;
 };
 
 // Makes the empty file with its mode.
@@ -103,16 +137,56 @@ SqliteVoicemailStore::Found SqliteVoicemailStore::find(Place* place, Purpose pur
   place->folder = folder_(purpose);
   if (place->folder < 0) return missing();
   const int folder = place->folder;
+  struct stat info {};
+  if (::fstat(folder, &info) != 0) return Found::unusable;
+  place->folderIs = Identity::of(info);
+  if (database_ != nullptr && place->folderIs == database_->folderIs &&
+      ::fstatat(folder, kFile, &info, AT_SYMLINK_NOFOLLOW) == 0 && Identity::of(info) == database_->fileIs &&
+      info.st_mode == (S_IFREG | 0600)) {
+    place->fileIs = database_->fileIs;
+    return Found::database;
+  }
+  // Closed before the file is looked at: closing any descriptor of a file gives up the process's locks on it.
+  database_.reset();
   UniqueFd database(::openat(folder, kFile, O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
   if (!database.isValid() && errno == ENOENT && purpose == Purpose::writing) {
     database.reset(::openat(folder, kFile, O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   }
   if (!database.isValid()) return missing();
-  struct stat info {};
   if (::fstat(database.get(), &info) != 0 || !S_ISREG(info.st_mode)) return Found::unusable;
   if ((info.st_mode & 07777) != 0600 && ::fchmod(database.get(), 0600) != 0) return Found::unusable;
-  place->file = pathInHeldFolder(folder, kFile);
+  place->fileIs = Identity::of(info);
   return Found::database;
+}
+
+int SqliteVoicemailStore::open(const Place& place, SqliteTimeLimit& limit) {
+  database_ = std::make_unique<Database>();
+  database_->folderIs = place.folderIs;
+  database_->fileIs = place.fileIs;
+  database_->folder.reset(::fcntl(place.folder, F_DUPFD_CLOEXEC, 0));
+  const int code = database_->folder.isValid()
+                       ? database_->open(pathInHeldFolder(database_->folder.get(), kFile), limit)
+                       : SQLITE_CANTOPEN;
+  if (code != SQLITE_OK) database_.reset();
+  return code;
+}
+
+// A database that is open already may have been changed below (its tables dropped, its bytes written over),
+// so a failure counts only with one that was opened for this operation.
+int SqliteVoicemailStore::run(const Place& place, SqliteTimeLimit& limit, const char* statement,
+                              const std::string* first, const std::string* second,
+                              std::optional<std::string>* result) {
+  int code = SQLITE_OK;
+  if (database_ != nullptr) {
+    code = database_->run(limit, statement, first, second, result);
+    if (code == SQLITE_OK) return code;
+    database_.reset();
+    if (limit.isOver()) return code;
+  }
+  code = open(place, limit);
+  if (code == SQLITE_OK) code = database_->run(limit, statement, first, second, result);
+  if (code != SQLITE_OK) database_.reset();
+  return code;
 }
 
 // Nothing in it can be read any more; a person may still want to look at it, so an earlier one stays, too.
@@ -141,11 +215,7 @@ bool SqliteVoicemailStore::write(const char* statement, const std::string* first
     for (int attempt = 0; attempt < 2; ++attempt) {
       Place place;
       if (find(&place, Purpose::writing) != Found::database) break;
-      {
-        Database database;
-        code = database.open(place.file, limit);
-        if (code == SQLITE_OK) code = database.run(statement, first, second, nullptr);
-      }
+      code = run(place, limit, statement, first, second, nullptr);
       if (!isDamage(code) || !moveAside(place)) break;
     }
   } catch (const std::bad_alloc&) {
@@ -164,11 +234,7 @@ bool SqliteVoicemailStore::read(const char* statement, const std::string* key,
     Place place;
     const Found found = find(&place, Purpose::reading);
     if (found == Found::nothing) return true;
-    if (found == Found::database) {
-      Database database;
-      code = database.open(place.file, limit);
-      if (code == SQLITE_OK) code = database.run(statement, key, nullptr, token);
-    }
+    if (found == Found::database) code = run(place, limit, statement, key, nullptr, token);
   } catch (const std::bad_alloc&) {
     code = SQLITE_NOMEM;
   }

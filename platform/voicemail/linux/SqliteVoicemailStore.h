@@ -4,6 +4,7 @@
 
 #include <chrono>
 #include <functional>
+#include <memory>
 #include <optional>
 #include <string>
 #include <utility>
@@ -12,6 +13,8 @@
 #include "platform/voicemail/VoicemailStore.h"
 
 namespace brenvik {
+
+class SqliteTimeLimit;
 
 // The tokens in an SQLite database, voicemail.db, which the first change makes. It is opened for each
 // operation, so that an idle process keeps neither it nor its lock. A database that is damaged is moved
@@ -29,8 +32,8 @@ class SqliteVoicemailStore final : public VoicemailStore {
   // `folder` gives the descriptor of its folder for each operation, which it keeps open; -1 with ENOENT:
   // there is none yet, and the store is empty. It may throw std::bad_alloc.
   using Folder = std::function<int(Purpose)>;
-  explicit SqliteVoicemailStore(Folder folder, SqliteTime time = SqliteTime::ofTheSystem())
-      : folder_(std::move(folder)), time_(std::move(time)) {}
+  explicit SqliteVoicemailStore(Folder folder, SqliteTime time = SqliteTime::ofTheSystem());
+  ~SqliteVoicemailStore() override;
 
   bool setToken(const std::string* token) noexcept override;
   bool setTokenForKey(const std::string& key, const std::string& token) noexcept override;
@@ -40,16 +43,21 @@ class SqliteVoicemailStore final : public VoicemailStore {
 
  private:
   class Database;
+  struct Identity;
   struct Place;
   enum class Found { database, nothing, unusable };
 
   Found find(Place* place, Purpose purpose);
+  int open(const Place& place, SqliteTimeLimit& limit);
+  int run(const Place& place, SqliteTimeLimit& limit, const char* statement, const std::string* first,
+          const std::string* second, std::optional<std::string>* result);
   static bool moveAside(const Place& place);
   bool write(const char* statement, const std::string* first, const std::string* second) noexcept;
   bool read(const char* statement, const std::string* key, std::optional<std::string>* token) noexcept;
 
   const Folder folder_;
   const SqliteTime time_;
+  std::unique_ptr<Database> database_;  // open, or null
 };
 
 }  // namespace brenvik

@@ -196,6 +196,32 @@ TEST_F(SqliteVoicemailStoreTest, AHomeBehindALinkIsTheSameHome) {
   EXPECT_EQ(store.copyToken(), token);
 }
 
+TEST_F(SqliteVoicemailStoreTest, WhatStandsInItsPlaceNowIsWhatCounts) {
+  store.setToken(&token);
+  StoreAtHome other(home / "other", ::getuid(), ::getgid());
+  home.directory("other");
+  const std::string theirs = "theirs";
+  other.setToken(&theirs);
+  const std::string otherFile = home / "other/Library/Voicemail/voicemail.db";
+  // The file, the folder with the same file, a new table in the same file, no file.
+  std::filesystem::rename(file, home / "kept");
+  std::filesystem::rename(otherFile, file);
+  EXPECT_EQ(store.copyToken(), theirs);
+  std::filesystem::rename(home / "Library/Voicemail", home / "moved");
+  home.directory("Library/Voicemail");
+  std::filesystem::rename(home / "moved/voicemail.db", file);
+  const std::string second = "second";
+  store.setToken(&second);
+  EXPECT_EQ(store.copyToken(), second);
+  plant("DROP TABLE general");
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  store.setToken(&token);
+  EXPECT_EQ(store.copyToken(), token);
+  std::filesystem::remove(file);
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  EXPECT_FALSE(isThere(file));
+}
+
 TEST_F(SqliteVoicemailStoreTest, WithoutAHomeTheStoreIsAlwaysEmpty) {
   RecordingLog log;
   for (const std::string& none : {std::string(), home / "missing"}) {
