@@ -51,6 +51,7 @@ class InstalledTree(unittest.TestCase):
 
     def test_programs_libraries_and_units_are_there(self):
         for pattern in (r"libexec/brenvik/BrenvikMobileHelper", r"libexec/brenvik/brenvik-archive-reader",
+                        r"libexec/brenvik/brenvik-store-worker",
                         r"lib.*/brenvik/brenvik-web\.so", r"bin/bvhelperctl", r"bin/brenvik-standin",
                         r"lib.*/libbrenvik-mobile-helper\.a",
                         r"lib.*/libbrenvik-mobile-helper\.so", r"lib.*/libbrenvik-mobile-helper\.so\.0",
