@@ -24,7 +24,6 @@
 #include "platform/accounts/linux/PasswordDatabase.h"
 #include "platform/base/Environment.h"
 #include "platform/baseband/linux/LoadedBasebandLibrary.h"
-#include "platform/contacts/linux/SqliteContacts.h"
 #include "platform/files/linux/LinuxFileManager.h"
 #include "platform/files/linux/ZipArchiveCopier.h"
 #include "platform/ipc/linux/SystemBootstrap.h"
@@ -41,9 +40,11 @@
 #include "platform/radio/linux/ModemManagerLogs.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/security/linux/EntitlementFiles.h"
+#include "platform/stores/RemoteContacts.h"
+#include "platform/stores/RemoteVoicemailStore.h"
+#include "platform/stores/linux/PreparedFolder.h"
 #include "platform/telephony/linux/ChannelTelephonyDaemon.h"
 #include "platform/voicemail/linux/DynamicVisualVoicemail.h"
-#include "platform/voicemail/linux/SqliteVoicemailStore.h"
 #include "platform/worker/linux/WorkerProgram.h"
 
 namespace brenvik {
@@ -99,11 +100,11 @@ class Areas {
   }
 
  private:
-  std::string home() const {
-    const char* const directory = mobile_.homeDirectory();
-    return directory != nullptr ? directory : "";
-  }
   MobileAccount account() const { return {mobile_.homeDirectory(), mobile_.uid(), mobile_.gid()}; }
+  PreparedFolder::Account storeAccount() const {
+    const char* const home = mobile_.homeDirectory();
+    return {home != nullptr ? home : "", mobile_.uid(), mobile_.gid()};
+  }
 
   SystemQueues& queues_;
   SystemRegions& regions_;
@@ -122,7 +123,12 @@ class Areas {
 
   CatalogueLabeler labeler_;
   LabelRoutines labels_{labeler_, regions_};
-  SqliteContacts contacts_{[this] { return home(); }};
+  WorkerProgram storeWorker_{{.service = stores::kService,
+                              .program = stores::kProgram,
+                              .bootstrap = BRENVIK_BOOTSTRAP_DIRECTORY,
+                              .folders = {}}};
+  PreparedFolder contactsFolder_{[this] { return storeAccount(); }, "AddressBook", stores::kContactsFile};
+  RemoteContacts contacts_{storeWorker_, contactsFolder_};
   ChannelRemap channelRemap_{contacts_};
 
   WorkerProgram networkWorker_{{.service = kNetworkWorkerService,
@@ -135,9 +141,8 @@ class Areas {
   ChannelMessagePorts messagePorts_{BRENVIK_BOOTSTRAP_DIRECTORY};
   RemoteEchoNetwork echoNetwork_{networkWorker_};
 
-  SqliteVoicemailStore voicemailStore_{[this] {
-    return SqliteVoicemailStore::Account{home(), mobile_.uid(), mobile_.gid()};
-  }};
+  PreparedFolder voicemailFolder_{[this] { return storeAccount(); }, "Voicemail", stores::kVoicemailFile};
+  RemoteVoicemailStore voicemailStore_{storeWorker_, voicemailFolder_};
   DynamicVisualVoicemail visualVoicemail_{BRENVIK_VISUAL_VOICEMAIL_LIBRARY, BRENVIK_VISUAL_VOICEMAIL_SYMBOL};
   VoicemailOperations voicemail_{voicemailStore_, visualVoicemail_};
 

@@ -54,6 +54,9 @@ WorkerResult WorkerChannel::send(const WorkerMessage& message) noexcept {
       message.descriptors.size() > WorkerMessage::kMostDescriptors) {
     return WorkerResult::malformed;
   }
+  const std::size_t count = std::min(message.descriptors.size(), WorkerMessage::kMostDescriptors);
+  std::array<int, WorkerMessage::kMostDescriptors> descriptors{};
+  for (std::size_t i = 0; i < count; ++i) descriptors[i] = message.descriptors[i].get();
   std::uint32_t kind = message.kind;
   std::array<iovec, 2> pieces{
       {{&kind, sizeof kind}, {const_cast<std::byte*>(message.payload.data()), message.payload.size()}}};
@@ -61,18 +64,15 @@ WorkerResult WorkerChannel::send(const WorkerMessage& message) noexcept {
   out.msg_iov = pieces.data();
   out.msg_iovlen = pieces.size();
   alignas(cmsghdr) std::array<char, CMSG_SPACE(WorkerMessage::kMostDescriptors * sizeof(int))> control{};
-  if (!message.descriptors.empty()) {
-    const std::size_t bytes = message.descriptors.size() * sizeof(int);
+  if (count > 0) {
+    const std::size_t bytes = count * sizeof(int);
     out.msg_control = control.data();
     out.msg_controllen = CMSG_SPACE(bytes);
     cmsghdr* const item = CMSG_FIRSTHDR(&out);
     item->cmsg_level = SOL_SOCKET;
     item->cmsg_type = SCM_RIGHTS;
     item->cmsg_len = CMSG_LEN(bytes);
-    for (std::size_t i = 0; i < message.descriptors.size(); ++i) {
-      const int fd = message.descriptors[i].get();
-      std::memcpy(CMSG_DATA(item) + i * sizeof fd, &fd, sizeof fd);
-    }
+    std::memcpy(CMSG_DATA(item), descriptors.data(), bytes);
   }
   for (;;) {
     if (::sendmsg(socket_.get(), &out, MSG_DONTWAIT | MSG_NOSIGNAL) >= 0) return WorkerResult::done;

@@ -51,7 +51,8 @@ class InstalledTree(unittest.TestCase):
 
     def test_programs_libraries_and_units_are_there(self):
         for pattern in (r"libexec/brenvik/BrenvikMobileHelper", r"libexec/brenvik/brenvik-archive-reader",
-                        r"libexec/brenvik/brenvik-network-worker", r"bin/bvhelperctl", r"bin/brenvik-standin",
+                        r"libexec/brenvik/brenvik-network-worker", r"libexec/brenvik/brenvik-store-worker",
+                        r"bin/bvhelperctl", r"bin/brenvik-standin",
                         r"lib.*/libbrenvik-mobile-helper\.a",
                         r"lib.*/libbrenvik-mobile-helper\.so", r"lib.*/libbrenvik-mobile-helper\.so\.0",
                         r"include/brenvik/mobile_helper\.h", r"lib.*/pkgconfig/brenvik-mobile-helper\.pc",
