@@ -20,9 +20,11 @@
 #include "helper/lasd/HttpFetcher.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/gzip/linux/ZlibGunzip.h"
+#include "platform/network/linux/NetworkAnswers.h"
+#include "platform/network/linux/RemoteWebClient.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/web/fakes/HttpsServer.h"
-#include "platform/web/linux/curl/CurlWebClient.h"
+#include "platform/worker/linux/WorkerProgram.h"
 
 // What an update costs beside the least it could: a fetch of 100 MiB over TLS beside the curl program,
 // whole processes both, and gunzipping 200 MiB into a file beside a bare zlib loop that does the same.
@@ -35,6 +37,7 @@ constexpr std::size_t kFetchSize = std::size_t{100} << 20;
 constexpr std::size_t kUnpackedSize = std::size_t{200} << 20;
 // This program's own argument for being the process that fetches.
 constexpr const char kFetchOnce[] = "--fetch-once";
+constexpr const char kWorker[] = "FetchWorker";
 
 void require(bool holds, const char* what) {
   if (holds) return;
@@ -58,6 +61,8 @@ class Folder {
     std::string name = std::filesystem::temp_directory_path() / "fetch-benchmark.XXXXXX";
     require(::mkdtemp(name.data()) != nullptr, "mkdtemp");
     path = name;
+    // The worker, which is no more than anybody once it runs, reads its authority there.
+    std::filesystem::permissions(path, std::filesystem::perms(0755));
   }
   ~Folder() { std::filesystem::remove_all(path); }
   std::filesystem::path path;
@@ -92,6 +97,7 @@ class WebServer {
  public:
   explicit WebServer(const std::filesystem::path& folder) : identity_(authority_, "DNS:localhost") {
     authority_.writeCertificate(folder / "authority.pem");
+    std::filesystem::copy_file(BRENVIK_FETCH_WORKER, folder / kWorker);
     identity_.writeCertificate(folder / "server.pem");
     identity_.writeKey(folder / "server.key");
     std::ofstream(folder / "body") << someText(kFetchSize);
@@ -131,15 +137,16 @@ const Folder& folder() {
 }
 WebServer* webServer = nullptr;
 
-// What a process of ours does that is started for one fetch.
-void fetchOnce(const std::string& url, const std::string& authority) {
+// What a process of ours does that is started for one fetch: it starts the worker, which does the work.
+void fetchOnce(const std::string& url, const std::string& workers) {
   const auto loop = SystemRunLoop::make();
   SystemQueues queues(*loop);
-  CurlSettings settings;
-  settings.certificateAuthorities = authority;
-  const auto client = CurlWebClient::make(queues, settings);
+  WorkerProgram worker(
+      {.service = "none", .program = kWorker, .bootstrap = "/nonexistent", .folders = {workers}});
+  NetworkAnswers answers(queues, worker);
+  RemoteWebClient client(answers);
   ZlibGunzip gunzip;
-  HttpFetcher fetcher({queues, *client, gunzip});
+  HttpFetcher fetcher({queues, client, gunzip});
   require(fetcher.fetch(url, WifiOnly::yes), "the fetch failed");
   require(fetcher.bodyAsData().size() == kFetchSize, "the body is not whole");
 }
@@ -155,9 +162,8 @@ double processorTimeOf(std::vector<std::string> words) {
 }
 
 void fetchIntoMemory(benchmark::State& state) {
-  const std::string authority = folder().path / "authority.pem";
   for (auto _ : state)
-    state.SetIterationTime(processorTimeOf({"/proc/self/exe", kFetchOnce, webServer->url(), authority}));
+    state.SetIterationTime(processorTimeOf({"/proc/self/exe", kFetchOnce, webServer->url(), folder().path}));
 }
 
 double processorTimeOfCurl(const std::string& output) {

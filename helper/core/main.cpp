@@ -24,24 +24,28 @@
 #include "platform/accounts/linux/PasswordDatabase.h"
 #include "platform/base/Environment.h"
 #include "platform/baseband/linux/LoadedBasebandLibrary.h"
-#include "platform/contacts/linux/SqliteContacts.h"
 #include "platform/files/linux/LinuxFileManager.h"
 #include "platform/files/linux/ZipArchiveCopier.h"
-#include "platform/geo/linux/SystemGeoService.h"
 #include "platform/ipc/linux/SystemBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/labeler/linux/CatalogueLabeler.h"
 #include "platform/log/linux/SystemLog.h"
 #include "platform/messageport/linux/ChannelMessagePorts.h"
-#include "platform/net/linux/SystemEchoNetwork.h"
+#include "platform/network/linux/NetworkAnswers.h"
+#include "platform/network/linux/RemoteEchoNetwork.h"
+#include "platform/network/linux/RemoteGeoService.h"
+#include "platform/network/linux/RemoteGunzip.h"
+#include "platform/network/linux/RemoteWebClient.h"
 #include "platform/preferences/linux/FilePreferences.h"
 #include "platform/radio/linux/ModemManagerLogs.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/security/linux/EntitlementFiles.h"
+#include "platform/stores/RemoteContacts.h"
+#include "platform/stores/RemoteVoicemailStore.h"
+#include "platform/stores/linux/PreparedFolder.h"
 #include "platform/telephony/linux/ChannelTelephonyDaemon.h"
 #include "platform/voicemail/linux/DynamicVisualVoicemail.h"
-#include "platform/voicemail/linux/SqliteVoicemailStore.h"
-#include "platform/web/linux/LoadedWebModule.h"
+#include "platform/worker/linux/WorkerProgram.h"
 
 namespace brenvik {
 namespace {
@@ -75,8 +79,8 @@ class Areas {
   Areas(SystemQueues& queues, SystemRegions& regions, PasswordDatabase& accounts)
       : queues_(queues), regions_(regions), mobile_(MobileUser::processWide(accounts)) {
     LASDUpdater::shared()->configure({.queues = queues_,
-                                      .web = web_.webClient(),
-                                      .gunzip = web_.gunzip(),
+                                      .web = web_,
+                                      .gunzip = gunzip_,
                                       .preferences = preferences_,
                                       .messagePorts = messagePorts_});
     CellularHeartbeat::shared().configure({.queues = queues_, .network = echoNetwork_});
@@ -88,18 +92,19 @@ class Areas {
 
   // Ends the work of other threads.
   void shutDown() noexcept {
-    // The first lets a transfer under way end, for which a check would wait.
-    web_.shutDown();
+    // The first two let a transfer and an unpacking under way end, for which a check would wait.
+    networkAnswers_.shutDown();
+    gunzip_.shutDown();
     LASDUpdater::shared()->shutDown();
     CellularHeartbeat::shared().shutDown();
   }
 
  private:
-  std::string home() const {
-    const char* const directory = mobile_.homeDirectory();
-    return directory != nullptr ? directory : "";
-  }
   MobileAccount account() const { return {mobile_.homeDirectory(), mobile_.uid(), mobile_.gid()}; }
+  PreparedFolder::Account storeAccount() const {
+    const char* const home = mobile_.homeDirectory();
+    return {home != nullptr ? home : "", mobile_.uid(), mobile_.gid()};
+  }
 
   SystemQueues& queues_;
   SystemRegions& regions_;
@@ -118,25 +123,30 @@ class Areas {
 
   CatalogueLabeler labeler_;
   LabelRoutines labels_{labeler_, regions_};
-  SqliteContacts contacts_{[this] { return home(); }};
+  WorkerProgram storeWorker_{{.service = stores::kService,
+                              .program = stores::kProgram,
+                              .bootstrap = BRENVIK_BOOTSTRAP_DIRECTORY,
+                              .folders = {}}};
+  PreparedFolder contactsFolder_{[this] { return storeAccount(); }, "AddressBook", stores::kContactsFile};
+  RemoteContacts contacts_{storeWorker_, contactsFolder_};
   ChannelRemap channelRemap_{contacts_};
 
-  LoadedWebModule web_{queues_};
+  WorkerProgram networkWorker_{{.service = kNetworkWorkerService,
+                                .program = BRENVIK_NETWORK_WORKER,
+                                .bootstrap = BRENVIK_BOOTSTRAP_DIRECTORY,
+                                .folders = {}}};
+  NetworkAnswers networkAnswers_{queues_, networkWorker_};
+  RemoteWebClient web_{networkAnswers_};
+  RemoteGunzip gunzip_{networkWorker_};
   ChannelMessagePorts messagePorts_{BRENVIK_BOOTSTRAP_DIRECTORY};
-  SystemEchoNetwork echoNetwork_;
+  RemoteEchoNetwork echoNetwork_{networkWorker_};
 
-  SqliteVoicemailStore voicemailStore_{[this] {
-    return SqliteVoicemailStore::Account{home(), mobile_.uid(), mobile_.gid()};
-  }};
+  PreparedFolder voicemailFolder_{[this] { return storeAccount(); }, "Voicemail", stores::kVoicemailFile};
+  RemoteVoicemailStore voicemailStore_{storeWorker_, voicemailFolder_};
   DynamicVisualVoicemail visualVoicemail_{BRENVIK_VISUAL_VOICEMAIL_LIBRARY, BRENVIK_VISUAL_VOICEMAIL_SYMBOL};
   VoicemailOperations voicemail_{voicemailStore_, visualVoicemail_};
 
-  SystemGeoService geoService_{queues_,
-                               web_.webClient(),
-                               {.geocoderUrl = BRENVIK_GEOCODER_URL,
-                                .gazetteer = BRENVIK_GAZETTEER,
-                                .stunServer = BRENVIK_STUN_SERVER,
-                                .countryFiles = {.configuration = BRENVIK_COUNTRY_CONFIGURATION}}};
+  RemoteGeoService geoService_{networkAnswers_, {.configuration = BRENVIK_COUNTRY_CONFIGURATION}};
   ChannelTelephonyDaemon telephonyDaemon_{BRENVIK_BOOTSTRAP_DIRECTORY};
   LocationRoutines location_{queues_, geoService_, telephonyDaemon_, GeoRequestState::shared()};
 

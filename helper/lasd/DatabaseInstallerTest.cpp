@@ -230,11 +230,10 @@ TEST_F(DatabaseInstallerTest, AFailedRenameSaysWhyAndKeepsTheTemporaryFile) {
   class Thief final : public Gunzip {
    public:
     explicit Thief(std::string path) : path_(std::move(path)) {}
-    GunzipResult gunzip(std::span<const std::byte>, std::uint64_t,
-                        const Receiver& receiver) noexcept override {
-      receiver(std::as_bytes(std::span("newer", 5)));
+    GunzipOutcome gunzipInto(const GunzipInput&, int file, std::uint64_t, std::uint64_t) noexcept override {
+      EXPECT_EQ(::write(file, "newer", 5), 5);
       std::filesystem::remove(path_);
-      return GunzipResult::whole;
+      return {GunzipResult::whole, 5, 0};
     }
 
    private:

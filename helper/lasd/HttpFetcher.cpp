@@ -60,14 +60,10 @@ UniqueFd openOutput(const char* path) {
   return file;
 }
 
-bool writeAll(int file, std::span<const std::byte> bytes) {
-  while (!bytes.empty()) {
-    const auto written = ::write(file, bytes.data(), bytes.size());
-    if (written < 0 && errno == EINTR) continue;
-    if (written <= 0) return false;
-    bytes = bytes.subspan(static_cast<std::size_t>(written));
-  }
-  return true;
+// What was written for us stands there, whoever says so.
+bool hasSize(int file, std::uint64_t size) noexcept {
+  struct stat status {};
+  return ::fstat(file, &status) == 0 && static_cast<std::uint64_t>(status.st_size) == size;
 }
 
 void tellWriteError(const std::string& path) {
@@ -180,15 +176,14 @@ bool HttpFetcher::uncompressInto(int file, const std::string& path) {
   const DiskSpace disk = parts_.diskSpace(file);
   const std::uint64_t reserve = diskReserve(disk.size);
   const std::uint64_t room = disk.available > reserve ? disk.available - reserve : 0;
-  std::uint64_t need = 0;
-  const auto receive = [&](std::span<const std::byte> output) {
-    need += output.size();
-    if (need > room || writeAll(file, output)) return true;
+  const auto [result, need, writeError] =
+      parts_.gunzip.gunzipInto({body_, body_.sealedMemory()}, file, room, room + kMostCountedBeyondRoom);
+  if (result == GunzipResult::refused) {
+    errno = writeError;
     tellWriteError(path);
     return false;
-  };
-  const auto result = parts_.gunzip.gunzip(body_, room + kMostCountedBeyondRoom, receive);
-  if (need <= room) return result == GunzipResult::whole;
+  }
+  if (need <= room) return result == GunzipResult::whole && hasSize(file, need);
   // Of a file that turns out to be damaged nobody knows how much room it needs.
   if (result == GunzipResult::whole || result == GunzipResult::tooLarge) {
     logUnified(LogLevel::error,

@@ -290,9 +290,9 @@ TEST_F(HttpFetcherTest, APartialFileThatCannotBeRemovedIsTold) {
   class Thief final : public Gunzip {
    public:
     explicit Thief(std::string path) : path_(std::move(path)) {}
-    GunzipResult gunzip(std::span<const std::byte>, std::uint64_t, const Receiver&) noexcept override {
+    GunzipOutcome gunzipInto(const GunzipInput&, int, std::uint64_t, std::uint64_t) noexcept override {
       std::filesystem::remove(path_);
-      return GunzipResult::damaged;
+      return {GunzipResult::damaged, 0, 0};
     }
 
    private:
@@ -306,6 +306,23 @@ TEST_F(HttpFetcherTest, APartialFileThatCannotBeRemovedIsTold) {
   EXPECT_EQ(log.entries(), (Lines{error("Could not uncompress HTTP response to " + path() + "!"),
                                   error("Failed to remove partially uncompressed file at " + path() +
                                         ": No such file or directory")}));
+}
+
+TEST_F(HttpFetcherTest, AFileOfAnotherSizeThanWasSaidIsNotTaken) {
+  class Liar final : public Gunzip {
+   public:
+    GunzipOutcome gunzipInto(const GunzipInput&, int file, std::uint64_t, std::uint64_t) noexcept override {
+      EXPECT_EQ(::write(file, "part", 4), 4);
+      return {GunzipResult::whole, 8, 0};
+    }
+  } liar;
+  web.answer(kUrl, 200, "x", gzipType);
+  HttpFetcher fetcher({queues, web, liar, roomyDisk});
+  ASSERT_TRUE(fetcher.fetch(kUrl, WifiOnly::yes));
+  log.clear();
+  EXPECT_FALSE(fetcher.uncompressTo(path()));
+  EXPECT_EQ(log.entries(), Lines{error("Could not uncompress HTTP response to " + path() + "!")});
+  EXPECT_FALSE(std::filesystem::exists(path()));
 }
 
 TEST_F(HttpFetcherTest, ALimitOnTheBodyIsTheRequests) {

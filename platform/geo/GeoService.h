@@ -76,11 +76,11 @@ class GeoIpTicket {
                       const std::shared_ptr<WorkQueue>& handlerQueue) = 0;
 };
 
-// The platform's geo service. Any thread. It must outlive its tickets; answers that are under way when it is
-// destroyed are dropped.
-class GeoService {
+// Looks things up for whoever asks. Any thread. It must outlive its tickets; answers that are under way when
+// it is destroyed are dropped.
+class GeoTickets {
  public:
-  virtual ~GeoService() = default;
+  virtual ~GeoTickets() = default;
 
   // A ticket for the address at a coordinate. Never null.
   virtual std::unique_ptr<ReverseGeocodeTicket> makeReverseGeocodeTicket(Coordinate coordinate,
@@ -91,7 +91,11 @@ class GeoService {
   // A ticket for what is known of an address; absent: of the address under which this device is seen from
   // outside. Never null.
   virtual std::unique_ptr<GeoIpTicket> makeGeoIpTicket(const std::optional<std::string>& ipAddress) = 0;
+};
 
+// The platform's geo service: the look-ups, and the country that this device is configured for.
+class GeoService : public GeoTickets {
+ public:
   // The country code of the shared country configuration, or nothing. Reads small files at most.
   virtual std::optional<std::string> currentCountryCode() = 0;
 };

@@ -4,7 +4,6 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <functional>
 #include <span>
 
 namespace brenvik {
@@ -14,23 +13,35 @@ enum class GunzipResult {
   damaged,    // not gzip, a checksum or length is wrong, or bytes follow the last member
   truncated,  // the input ends within a member
   tooLarge,   // more output than allowed
-  refused,    // the receiver of the output said no
+  refused,    // the output could not be written, or its receiver said no
   outOfMemory,
-  unavailable,  // the decompressor could not be loaded
+  unavailable,  // the decompressor cannot be had, or did not end in time
+};
+
+// A gzip file in memory.
+struct GunzipInput {
+  std::span<const std::byte> bytes;
+  // The sealed memory that holds these very bytes from its beginning, where there is one; -1: none. It can be
+  // handed to another process as it is.
+  int sealedMemory = -1;
+};
+
+struct GunzipOutcome {
+  GunzipResult result = GunzipResult::unavailable;
+  std::uint64_t size = 0;  // of the output so far, what was only counted included
+  int writeError = 0;      // with `refused`, the number of the error of the write
 };
 
 // Decompresses gzip files (RFC 1952), of one or several members. Any thread.
 class Gunzip {
  public:
-  // Takes the next bytes of the output; false ends the work.
-  using Receiver = std::function<bool(std::span<const std::byte> output)>;
-
   virtual ~Gunzip() = default;
 
-  // Hands the output over piece by piece, never more than `largestOutput` bytes in all; what it handed over
-  // is worth nothing unless the result is `whole`. An empty input is truncated.
-  virtual GunzipResult gunzip(std::span<const std::byte> input, std::uint64_t largestOutput,
-                              const Receiver& receiver) noexcept = 0;
+  // Writes the output to a file, from where that stands, as long as there are at most `room` bytes of it.
+  // What goes beyond is only counted, up to `largestOutput`. The file is worth nothing unless the result is
+  // `whole` and the size within the room. An empty input is truncated.
+  virtual GunzipOutcome gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
+                                   std::uint64_t largestOutput) noexcept = 0;
 };
 
 }  // namespace brenvik

@@ -3,11 +3,11 @@
 #include "platform/sqlite/Sqlite.h"
 
 #include <dlfcn.h>
-#include <fcntl.h>
 
 #include <mutex>
 
 #include "platform/base/Library.h"
+#include "platform/sqlite/HeldFolder.h"
 
 namespace brenvik {
 namespace {
@@ -20,18 +20,14 @@ bool look(void* library, const char* name, Function* function) noexcept {
   return *function != nullptr;
 }
 
-// A pipe may stand where a journal belongs, and opening one for reading waits for a writer. For regular files
-// the flag means nothing.
-int openWithoutWaiting(const char* path, int flags, int mode) noexcept {
-  return ::open(path, flags | O_NONBLOCK, mode);
-}
-
 bool limit(const SqliteFunctions& functions) noexcept {
   (void)functions.hard_heap_limit64(kMostSqliteMemory);
   sqlite3_vfs* const files = functions.vfs_find(nullptr);
   return files != nullptr && files->iVersion >= 3 &&
-         files->xSetSystemCall(files, "open", reinterpret_cast<sqlite3_syscall_ptr>(&openWithoutWaiting)) ==
-             SQLITE_OK;
+         understandHeldFolders(files, [](void* vfs, const char* name, void (*function)()) {
+           auto* const of = static_cast<sqlite3_vfs*>(vfs);
+           return of->xSetSystemCall(of, name, function) == SQLITE_OK;
+         });
 }
 
 bool load(SqliteFunctions* functions, bool* lackedMemory) noexcept {

@@ -3,12 +3,16 @@
 #include "platform/web/WebBody.h"
 
 #include <sys/mman.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <limits>
 #include <new>
+
+#include "platform/base/SealedMemory.h"
 
 namespace brenvik {
 namespace {
@@ -25,10 +29,57 @@ std::byte* map(std::size_t capacity) {
   return static_cast<std::byte*>(made);
 }
 
+void writeAll(int memory, std::span<const std::byte> bytes) {
+  while (!bytes.empty()) {
+    const auto written = ::write(memory, bytes.data(), bytes.size());
+    if (written < 0 && errno == EINTR) continue;
+    if (written <= 0) throw std::bad_alloc();
+    bytes = bytes.subspan(static_cast<std::size_t>(written));
+  }
+}
+
 }  // namespace
 
+WebBody WebBody::forAnotherProcess() {
+  WebBody body;
+  body.memory_.reset(::memfd_create("brenvik-body", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+  if (!body.memory_.isValid()) throw std::bad_alloc();
+  body.form_ = Form::forAnotherProcess;
+  return body;
+}
+
+UniqueFd WebBody::takeSealed() noexcept {
+  WebBody body = std::move(*this);
+  size_ = 0;
+  if (body.form_ != Form::forAnotherProcess || !sealAgainstChange(body.memory_.get())) return {};
+  return std::move(body.memory_);
+}
+
+std::optional<WebBody> WebBody::ofSealedMemory(UniqueFd memory, std::uint64_t size) {
+  const auto length = sizeOfSealedMemory(memory.get());
+  if (size == 0 || length < 0 || static_cast<std::uint64_t>(length) != size) return std::nullopt;
+  WebBody body;
+  void* const mapped = mapSealedMemory(memory.get(), static_cast<std::size_t>(size));
+  if (mapped == nullptr) throw std::bad_alloc();
+  body.data_ = static_cast<std::byte*>(mapped);
+  body.size_ = static_cast<std::size_t>(size);
+  body.memory_ = std::move(memory);
+  body.form_ = Form::sealed;
+  return body;
+}
+
+void WebBody::clear() noexcept {
+  if (form_ == Form::sealed) *this = WebBody();
+  // The next bytes go to the beginning. It was written there before, so cutting it off does not fail.
+  if (form_ == Form::forAnotherProcess && size_ > 0)
+    (void)!(::ftruncate(memory_.get(), 0) == 0 && ::lseek(memory_.get(), 0, SEEK_SET) == 0);
+  size_ = 0;
+}
+
 WebBody::~WebBody() {
-  if (isMapped(capacity_)) {
+  if (form_ == Form::sealed) {
+    (void)::munmap(data_, size_);
+  } else if (isMapped(capacity_)) {
     (void)::munmap(data_, capacity_);
   } else {
     std::free(data_);
@@ -36,6 +87,12 @@ WebBody::~WebBody() {
 }
 
 void WebBody::reserve(std::size_t capacity) {
+  if (form_ == Form::forAnotherProcess) return;
+  if (form_ == Form::sealed) {  // what others have filled becomes one of its own
+    WebBody own;
+    own.append(*this);
+    *this = std::move(own);
+  }
   if (capacity <= capacity_) return;
   if (!isMapped(capacity)) {
     void* const larger = std::realloc(data_, capacity);
@@ -62,6 +119,12 @@ void WebBody::reserve(std::size_t capacity) {
 
 void WebBody::append(std::span<const std::byte> bytes) {
   if (bytes.empty()) return;
+  if (form_ == Form::sealed) reserve(0);
+  if (form_ == Form::forAnotherProcess) {
+    writeAll(memory_.get(), bytes);
+    size_ += bytes.size();
+    return;
+  }
   if (bytes.size() > capacity_ - size_) {
     if (bytes.size() > std::numeric_limits<std::size_t>::max() / 2 - size_) throw std::bad_alloc();
     reserve(std::max(size_ + bytes.size(), capacity_ * 2));

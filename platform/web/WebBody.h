@@ -3,8 +3,12 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
+#include <optional>
 #include <span>
 #include <utility>
+
+#include "platform/base/UniqueFd.h"
 
 namespace brenvik {
 
@@ -18,31 +22,53 @@ class WebBody {
   WebBody(WebBody&& other) noexcept
       : data_(std::exchange(other.data_, nullptr)),
         size_(std::exchange(other.size_, 0)),
-        capacity_(std::exchange(other.capacity_, 0)) {}
+        capacity_(std::exchange(other.capacity_, 0)),
+        memory_(std::move(other.memory_)),
+        form_(std::exchange(other.form_, Form::own)) {}
   WebBody& operator=(WebBody other) noexcept {
     std::swap(data_, other.data_);
     std::swap(size_, other.size_);
     std::swap(capacity_, other.capacity_);
+    std::swap(memory_, other.memory_);
+    std::swap(form_, other.form_);
     return *this;
   }
   ~WebBody();
 
+  // A body that is filled for another process: it has a size, and data that only takeSealed() makes readable.
+  // It is written, not mapped: that way fresh pages need not be cleared first. A copy of it is empty. Throws
+  // std::bad_alloc.
+  static WebBody forAnotherProcess();
+  // Its memory, sealed; the body is empty afterwards. Invalid when the kernel refuses.
+  UniqueFd takeSealed() noexcept;
+  // A body that another process has filled, mapped for reading. Nothing when the memory can still change, or
+  // is not of exactly this size. Throws std::bad_alloc.
+  static std::optional<WebBody> ofSealedMemory(UniqueFd memory, std::uint64_t size);
+  // The memory of such a one, which stays its own; of every other body -1.
+  int sealedMemory() const noexcept { return form_ == Form::sealed ? memory_.get() : -1; }
+
   const std::byte* data() const noexcept { return data_; }
   std::size_t size() const noexcept { return size_; }
-  std::size_t capacity() const noexcept { return capacity_; }
+  std::size_t capacity() const noexcept { return capacity_; }  // of a body of its own
   bool empty() const noexcept { return size_ == 0; }
-  operator std::span<const std::byte>() const noexcept { return {data_, size_}; }  // NOLINT: it is one
+  operator std::span<const std::byte>() const noexcept {  // NOLINT: it is one
+    return {data_, data_ != nullptr ? size_ : 0};
+  }
 
-  // Keeps the capacity.
-  void clear() noexcept { size_ = 0; }
+  // Keeps the capacity, if it is one of its own.
+  void clear() noexcept;
   void reserve(std::size_t capacity);
   // The bytes are not this body's own.
   void append(std::span<const std::byte> bytes);
 
  private:
+  enum class Form { own, forAnotherProcess, sealed };
+
   std::byte* data_ = nullptr;
   std::size_t size_ = 0;
-  std::size_t capacity_ = 0;  // a whole number of kLargeUnit: mapped; else from the heap
+  std::size_t capacity_ = 0;  // a whole number of kLargeUnit: mapped; else from the heap. 0 when sealed
+  UniqueFd memory_;
+  Form form_ = Form::own;
 };
 
 }  // namespace brenvik

@@ -50,6 +50,9 @@ class WebRequest {
   virtual void setLargestBody(std::uint64_t bytes) noexcept = 0;
   // Starts the request and returns at once. A get carries no body, so what is given is not sent.
   virtual void send(std::vector<std::byte> body) = 0;
+  // A request under way completes as cancelled, a while later; one that has not been sent never is. Whatever
+  // the outcome, the completion runs once.
+  virtual void cancel() noexcept = 0;
 };
 
 // The platform's HTTP client: https only, certificates checked against the system's trust store, redirects

@@ -54,6 +54,8 @@ const char* textOfErrorKind(WebErrorKind kind) noexcept {
       return "malformed response";
     case WebErrorKind::outOfMemory:
       return "out of memory";
+    case WebErrorKind::unusableUrl:
+      return "URL cannot be used";
   }
   return "unknown error";
 }

@@ -43,6 +43,7 @@ enum class WebErrorKind : std::int32_t {
   bodyTooLarge = 14,
   malformedResponse = 15,  // not HTTP, or content that does not decode
   outOfMemory = 16,
+  unusableUrl = 17,  // the client itself, which looks closer than whoever made the request, does not take it
 };
 
 // A response, or what is known of a transfer that failed.

@@ -200,6 +200,18 @@ class Daemon:
                 names.append(pathlib.Path(f"/proc/{self.pid}/task/{task}/comm").read_text().strip())
         return sorted(names)
 
+    def network_worker(self):
+        """The process id of its network worker, None when there is none."""
+        children = pathlib.Path(f"/proc/{self.pid}/task").glob("*/children")
+        for pid in " ".join(path.read_text() for path in children).split():
+            with contextlib.suppress(FileNotFoundError, ProcessLookupError):
+                if "brenvik-network" in pathlib.Path(f"/proc/{pid}/cmdline").read_text():
+                    return int(pid)
+        return None
+
+    def network_worker_maps(self):
+        return pathlib.Path(f"/proc/{self.network_worker()}/maps").read_text()
+
     def cpu_seconds(self):
         """What it has computed so far, which no other work of the machine makes more."""
         fields = pathlib.Path(f"/proc/{self.pid}/stat").read_text().rsplit(")", 1)[1].split()

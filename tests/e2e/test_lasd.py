@@ -129,7 +129,7 @@ class Environment(UpdateTest):
 
 class Updates(UpdateTest):
     def test_all_five_are_installed_and_announced_in_order_and_a_second_check_finds_nothing_to_do(self):
-        self.assertNotIn("libcurl", self.daemon.maps())
+        self.assertIsNone(self.daemon.network_worker(), "it must not cost a start that has no use for it")
         manifest = self.serve({name: "1.0" for name in ORDER})
         self.assertEqual(self.check(count=5), available())
         self.assert_installed(manifest)
@@ -137,7 +137,9 @@ class Updates(UpdateTest):
         self.assert_asked("/1/v3/lasd.plist", *(f"/content/{n}.db.gz" for n in ORDER))
         for header in self.port.headers:
             self.assertEqual((header[0], header[2], header[3], header[4], header[5]), (0, 0, 0, 0, 0))
-        self.assertIn("libcurl", self.daemon.maps())
+        self.assertIn("libcurl", self.daemon.network_worker_maps())
+        for library in ("libcurl", "libssl", "libz."):
+            self.assertNotIn(library, self.daemon.maps())
         self.logs.wait_for("unified", INFO, "Trying to see if update available for mask 1f")
         self.logs.wait_for("unified", INFO, "Downloaded scdma database version 1.0 successfully")
 

@@ -182,7 +182,7 @@ class OfflineTest(LocationTest):
         self.ask_civic(self.client(), 0.0, 0.0)
         self.assertEqual(brenvik.wait_for(1), [civic("NO")])
         self.lines(CIVIC_ASKED, CIVIC_SENT)
-        self.assertNotIn("sqlite", self.daemon.maps())
+        self.assertIsNone(self.daemon.network_worker())
 
     def test_numbers_that_are_no_coordinate_are_an_error_and_the_fallback(self):
         brenvik = Brenvik(self)
@@ -567,7 +567,8 @@ class GeocoderTest(LocationTest):
         self.assertEqual((float(query["lat"][0]), float(query["lon"][0])), (48.8584, 2.2945))
         self.assertTrue(headers["User-Agent"].startswith("BrenvikMobileHelper/"))
         # The gazetteer looks over the country code: its rules hold for servers, too.
-        self.assertIn("sqlite", self.daemon.maps())
+        self.assertIn("sqlite", self.daemon.network_worker_maps())
+        self.assertNotIn("sqlite", self.daemon.maps())
 
     def test_unable_to_geocode_is_no_map_items(self):
         self.says('{"error":"Unable to geocode"}')

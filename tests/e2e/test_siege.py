@@ -392,10 +392,6 @@ class Siege(HelperTest):
         self.assertLessEqual(len(preferences), 16)
         return sorted(link for link in links if link not in preferences)
 
-    def address_queues(self):
-        """Questions for the public address that overlap have a queue each: four at most, made as they are needed, and kept."""
-        return self.daemon.threads().count("geo service: ad")
-
     def use_everything(self):
         """Queues, databases and the like are made on first use, and stay."""
         with wire.Client() as client:
@@ -428,20 +424,17 @@ class Siege(HelperTest):
         self.done = collections.Counter()
         seeds = random.Random(SEED)
         self.lay_siege(min(4.0, SECONDS), seeds)
-        before, queues, memory = self.settle(), self.address_queues(), self.daemon.resident_kib()
+        before, memory = self.settle(), self.daemon.resident_kib()
 
         self.lay_siege(SECONDS, seeds)
         self.assertEqual([what for _, what in BESIEGERS if self.done[what.__name__] == 0], [], "never to the end")
         end = time.monotonic() + 90
 
         def left_over():
-            # Three descriptors a queue.
-            made = collections.Counter({"anon_inode": 3 * (self.address_queues() - queues)})
-            return collections.Counter(self.descriptors()) - before - made
+            return collections.Counter(self.descriptors()) - before
 
         while left_over() and time.monotonic() < end:
             time.sleep(0.05)
-        self.assertLessEqual(self.address_queues(), 4)
         self.assertFalse(left_over(), self.daemon.threads())
         self.assertNotIn("memfd:", self.daemon.maps())
         grown = self.daemon.resident_kib() - memory

@@ -58,7 +58,8 @@ class InstalledTree(unittest.TestCase):
 
     def test_programs_libraries_and_units_are_there(self):
         for pattern in (r"libexec/brenvik/BrenvikMobileHelper", r"libexec/brenvik/brenvik-archive-reader",
-                        r"lib.*/brenvik/brenvik-web\.so", r"bin/bvhelperctl", r"bin/brenvik-standin",
+                        r"libexec/brenvik/brenvik-network-worker", r"libexec/brenvik/brenvik-store-worker",
+                        r"bin/bvhelperctl", r"bin/brenvik-standin",
                         r"lib.*/libbrenvik-mobile-helper\.a",
                         r"lib.*/libbrenvik-mobile-helper\.so", r"lib.*/libbrenvik-mobile-helper\.so\.0",
                         r"include/brenvik/mobile_helper\.h",
@@ -162,7 +163,7 @@ class InstalledTree(unittest.TestCase):
                    if each["name"] == "brenvik:soname"}
         needed = set()
         for pattern in (r"libexec/brenvik/BrenvikMobileHelper", r"libexec/brenvik/brenvik-archive-reader",
-                        r"lib.*/brenvik/brenvik-web\.so", r"bin/bvhelperctl", r"lib.*/libbrenvik-mobile-helper\.so\.0\..*"):
+                        r"libexec/brenvik/brenvik-network-worker", r"bin/bvhelperctl", r"lib.*/libbrenvik-mobile-helper\.so\.0\..*"):
             needed.update(re.findall(r"NEEDED +(\S+)", run("objdump", "-p", self.one(pattern))))
         sanitizers = {each for each in needed if re.match(r"lib(a|ub|t)san\.so", each)}
         self.assertEqual(needed - sanitizers - sonames, set())

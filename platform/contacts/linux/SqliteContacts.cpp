@@ -2,21 +2,21 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/contacts/linux/SqliteContacts.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 
-#include <cerrno>
-#include <climits>
-#include <cstdlib>
 #include <new>
+#include <string>
 #include <utility>
 
 #include "platform/base/Utf8.h"
 #include "platform/sqlite/ForeignDatabase.h"
+#include "platform/sqlite/HeldFolder.h"
 
 namespace brenvik {
 namespace {
 
-constexpr char kBelowHome[] = "/Library/AddressBook/contacts.db";
+constexpr char kFile[] = "contacts.db";
 
 class SqliteChannelManager final : public ContactsChannelManager {
  public:
@@ -24,7 +24,7 @@ class SqliteChannelManager final : public ContactsChannelManager {
       : limit_(patience, std::move(time)) {}
 
   // False when there is no database; throws std::bad_alloc when there may be one.
-  bool open(const std::string& path);
+  bool open(int folder);
 
   bool remapChannelIdentifier(std::string_view from, std::string_view to,
                               std::optional<std::string>* error) noexcept override {
@@ -79,19 +79,6 @@ class SqliteChannelManager final : public ContactsChannelManager {
   SqliteDatabase database_;
 };
 
-struct Free {
-  void operator()(char* memory) const noexcept { std::free(memory); }
-};
-
-// The database's path with the home's own links resolved; those below it are their owner's and are not
-// followed. Empty when there is no home.
-std::string databasePath(const std::string& home) {
-  if (home.empty()) return {};
-  const std::unique_ptr<char, Free> resolved(::realpath(home.c_str(), nullptr));
-  if (resolved == nullptr && errno == ENOMEM) throw std::bad_alloc();
-  return resolved == nullptr ? std::string() : std::string(resolved.get()) + kBelowHome;
-}
-
 // A file that answered with one of these will never be read as a database. Anything else (locked, damaged,
 // read-only) is for the remap to report.
 bool isHopeless(int result) noexcept {
@@ -107,9 +94,10 @@ bool isHopeless(int result) noexcept {
   }
 }
 
-bool SqliteChannelManager::open(const std::string& path) {
+bool SqliteChannelManager::open(int folder) {
   struct stat status {};
-  if (path.empty() || ::lstat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) return false;
+  if (folder < 0 || ::fstatat(folder, kFile, &status, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISREG(status.st_mode))
+    return false;
   // The permission bits say what the owner wants; root obeys them, too.
   if ((status.st_mode & (S_IRUSR | S_IRGRP | S_IROTH)) == 0) return false;
   const bool writable = (status.st_mode & (S_IWUSR | S_IWGRP | S_IWOTH)) != 0;
@@ -120,7 +108,7 @@ bool SqliteChannelManager::open(const std::string& path) {
   sqlite3* opened = nullptr;
   const int flags = (writable ? SQLITE_OPEN_READWRITE : SQLITE_OPEN_READONLY) | SQLITE_OPEN_NOFOLLOW |
                     SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_PRIVATECACHE;
-  const int result = sql->open_v2(path.c_str(), &opened, flags, nullptr);
+  const int result = sql->open_v2(pathInHeldFolder(folder, kFile).c_str(), &opened, flags, nullptr);
   database_.reset(opened);  // to be closed even when opening failed
   if (isLackOfMemory(result)) throw std::bad_alloc();
   if (result != SQLITE_OK) return false;
@@ -143,7 +131,7 @@ std::unique_ptr<ContactsChannelManager> SqliteContacts::makeChannelManager(bool*
   if (lackedMemory != nullptr) *lackedMemory = false;
   try {
     auto manager = std::make_unique<SqliteChannelManager>(patience_, time_);
-    if (!manager->open(databasePath(home_()))) return nullptr;
+    if (!manager->open(folder_())) return nullptr;
     return manager;
   } catch (const std::bad_alloc&) {
     if (lackedMemory != nullptr) *lackedMemory = true;

@@ -5,7 +5,6 @@
 #include <chrono>
 #include <functional>
 #include <memory>
-#include <string>
 #include <utility>
 
 #include "platform/contacts/ContactsChannelManager.h"
@@ -13,7 +12,7 @@
 
 namespace brenvik {
 
-// The contacts of one account, in <home>/Library/AddressBook/contacts.db.
+// The contacts in contacts.db of an open folder, with no right but this process's own.
 class SqliteContacts final : public ContactsService {
  public:
   // How long a manager may wait for other programs' locks and run statements, from its making on. With the
@@ -23,17 +22,17 @@ class SqliteContacts final : public ContactsService {
   // database's owner is less trusted than this process.
   static constexpr std::chrono::milliseconds kPatience{2000};
 
-  // `home` gives the account's home directory each time a manager is made; empty: there is none. Of
-  // exceptions it may throw std::bad_alloc.
-  explicit SqliteContacts(std::function<std::string()> home, std::chrono::milliseconds patience = kPatience,
+  // `folder` gives the descriptor of the folder each time a manager is made, which keeps it open as long as
+  // that lives; -1: there is none.
+  explicit SqliteContacts(std::function<int()> folder, std::chrono::milliseconds patience = kPatience,
                           SqliteTime time = SqliteTime::ofTheSystem())
-      : home_(std::move(home)), patience_(patience), time_(std::move(time)) {}
+      : folder_(std::move(folder)), patience_(patience), time_(std::move(time)) {}
 
-  // Null when there is no home, no database, none that may be read, or a file that is no database.
+  // Null when there is no folder, no database, none that may be read, or a file that is no database.
   std::unique_ptr<ContactsChannelManager> makeChannelManager(bool* lackedMemory = nullptr) noexcept override;
 
  private:
-  const std::function<std::string()> home_;
+  const std::function<int()> folder_;
   const std::chrono::milliseconds patience_;
   const SqliteTime time_;
 };

@@ -19,6 +19,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/base/UniqueFd.h"
 #include "platform/contacts/fakes/InMemoryContacts.h"
 #include "platform/sqlite/Sqlite.h"
 #include "platform/sqlite/fakes/ManualSqliteTime.h"
@@ -68,6 +69,7 @@ class SqliteContactsTest : public ::testing::Test {
     EXPECT_NE(::mkdtemp(name.data()), nullptr);
     home = fs::canonical(name);
     fs::create_directories(database().parent_path());
+    folder.reset(::open(database().parent_path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   }
   ~SqliteContactsTest() override { fs::remove_all(home); }
 
@@ -78,7 +80,7 @@ class SqliteContactsTest : public ::testing::Test {
              more);
   }
   SqliteContacts contacts() {
-    return SqliteContacts([this] { return home.string(); }, SqliteContacts::kPatience, time.asTime());
+    return SqliteContacts([this] { return folder.get(); }, SqliteContacts::kPatience, time.asTime());
   }
   // The description of the failure, or "success".
   std::string remap(const std::string& from = "old", const std::string& to = "new") {
@@ -94,6 +96,7 @@ class SqliteContactsTest : public ::testing::Test {
   }
 
   fs::path home;
+  UniqueFd folder;
   ManualSqliteTime time;
 };
 
@@ -130,15 +133,15 @@ TEST_F(SqliteContactsTest, AnAnsweredRemapIsHeldFastInItsFolder) {
     calls.emplace_back("unlink");
     return realUnlink(path);
   };
-  const auto openDirectory = +[](const char* path, int* folder) {
+  const auto openDirectory = +[](const char* path, int* opened) {
     calls.emplace_back("open folder to sync it");
-    return realOpenDirectory(path, folder);
+    return realOpenDirectory(path, opened);
   };
   files->xSetSystemCall(files, "unlink", reinterpret_cast<sqlite3_syscall_ptr>(unlink));
   files->xSetSystemCall(files, "openDirectory", reinterpret_cast<sqlite3_syscall_ptr>(openDirectory));
   EXPECT_EQ(remap(), "success");
-  files->xSetSystemCall(files, "unlink", nullptr);
-  files->xSetSystemCall(files, "openDirectory", nullptr);
+  files->xSetSystemCall(files, "unlink", reinterpret_cast<sqlite3_syscall_ptr>(realUnlink));
+  files->xSetSystemCall(files, "openDirectory", reinterpret_cast<sqlite3_syscall_ptr>(realOpenDirectory));
   ASSERT_FALSE(calls.empty());
   EXPECT_EQ(std::count(calls.begin(), calls.end(), "unlink"), 1);
   EXPECT_EQ(calls.back(), "open folder to sync it");
@@ -152,8 +155,7 @@ TEST_F(SqliteContactsTest, IdentifiersAreTextsAndNeverPartOfAStatement) {
 }
 
 TEST_F(SqliteContactsTest, WithoutAHomeADatabaseOrAReadableOneThereIsNoManager) {
-  EXPECT_EQ(SqliteContacts([] { return std::string(); }).makeChannelManager(), nullptr);
-  EXPECT_EQ(SqliteContacts([] { return std::string("/nonexistent"); }).makeChannelManager(), nullptr);
+  EXPECT_EQ(SqliteContacts([] { return -1; }).makeChannelManager(), nullptr);
   EXPECT_EQ(remap(), "no manager");
   EXPECT_FALSE(fs::exists(database())) << "a missing database must not be made";
   makeDatabase();
@@ -174,26 +176,19 @@ TEST_F(SqliteContactsTest, AFileThatIsNoDatabaseGivesNoManager) {
   EXPECT_EQ(remap(), "no manager");
 }
 
-TEST_F(SqliteContactsTest, LinksBelowTheHomeAreNotFollowed) {
+TEST_F(SqliteContactsTest, ALinkInTheDatabasesPlaceIsNotFollowed) {
   makeDatabase();
   fs::rename(database(), home / "elsewhere.db");
   fs::create_symlink(home / "elsewhere.db", database());
   EXPECT_EQ(remap(), "no manager");
-  fs::remove(database());
-  fs::create_directory(home / "folder");
-  fs::rename(home / "elsewhere.db", home / "folder/contacts.db");
-  fs::remove(database().parent_path());
-  fs::create_directory_symlink(home / "folder", database().parent_path());
-  EXPECT_EQ(remap(), "no manager");
 }
 
-TEST_F(SqliteContactsTest, ALinkInThePathToTheHomeIsFollowed) {
+TEST_F(SqliteContactsTest, TheFolderIsTheOneThatIsOpenWhereverItStands) {
   makeDatabase();
-  const fs::path link = home / "link";
-  fs::create_directory_symlink(home, link);
-  const auto manager = SqliteContacts([&] { return link.string(); }).makeChannelManager();
-  ASSERT_NE(manager, nullptr);
-  EXPECT_EQ(remap(*manager, "old", "new"), "success");
+  fs::rename(database().parent_path(), home / "elsewhere");
+  EXPECT_EQ(remap(), "success");
+  Application application(home / "elsewhere/contacts.db");
+  EXPECT_EQ(application.references("new"), 2);
 }
 
 TEST_F(SqliteContactsTest, AMissingTableIsAFailureWithItsDescription) {
@@ -330,7 +325,7 @@ TEST_F(SqliteContactsTest, AllLocksTogetherAreWaitedForOnlySoLong) {
     application.run("COMMIT; BEGIN; SELECT * FROM contact_channels");
     application.isReading = true;
   };
-  const auto manager = SqliteContacts([this] { return home.string(); }, SqliteContacts::kPatience, lettingGo)
+  const auto manager = SqliteContacts([this] { return folder.get(); }, SqliteContacts::kPatience, lettingGo)
                            .makeChannelManager();
   ASSERT_NE(manager, nullptr);
   EXPECT_EQ(remap(*manager, "old", "new"), "database is locked");
@@ -412,7 +407,7 @@ TEST_P(LargeRemapTest, AHundredThousandReferencesMoveAtOnceForAnotherProcessThat
   char byte = 0;
   EXPECT_EQ(::read(started[0], &byte, 1), 1);
 
-  const auto manager = SqliteContacts([this] { return home.string(); }, 20s).makeChannelManager();
+  const auto manager = SqliteContacts([this] { return folder.get(); }, 20s).makeChannelManager();
   ASSERT_NE(manager, nullptr);
   EXPECT_EQ(remap(*manager, "old", "new"), "success");
   ::close(alive[1]);
@@ -460,6 +455,7 @@ struct SqliteContract : Contract {
     EXPECT_NE(::mkdtemp(name.data()), nullptr);
     home = name;
     fs::create_directories(database().parent_path());
+    folder.reset(::open(database().parent_path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     Application(database()).run(kTable);
   }
   ~SqliteContract() override { fs::remove_all(home); }
@@ -474,7 +470,8 @@ struct SqliteContract : Contract {
   }
   void makeUnreachable() override { fs::remove(database()); }
   fs::path home;
-  SqliteContacts contacts{[this] { return home.string(); }};
+  UniqueFd folder;
+  SqliteContacts contacts{[this] { return folder.get(); }};
 };
 
 template <class T>

@@ -165,7 +165,6 @@ void ReverseGeocoder::deliverAddress(std::optional<StructuredAddress> address, c
   MapItems items;
   if (address) {
     fitIntoAPush(*address);
-    if (address->countryCode) found_(*address->countryCode);
     items.emplace_back(MapItem{true, GeoAddress{std::move(address)}});
   }
   deliver(std::move(items), std::nullopt);

@@ -33,14 +33,12 @@ class ReverseGeocoder : public std::enable_shared_from_this<ReverseGeocoder> {
   // Monotonic time, from any start.
   using Now = std::function<std::chrono::nanoseconds()>;
 
-  // `serverUrl` empty: no server, and `webClient` is not used. `found` is told the country of each answer.
+  // `serverUrl` empty: no server, and `webClient` is not used.
   ReverseGeocoder(std::string serverUrl, std::string gazetteerPath, WebClient& webClient, Now now,
-                  std::function<void(const std::string&)> found,
                   std::chrono::milliseconds pace = kGeocoderPace)
       : serverUrl_(std::move(serverUrl)),
         webClient_(webClient),
         now_(std::move(now)),
-        found_(std::move(found)),
         pace_(pace),
         gazetteer_(std::move(gazetteerPath)) {}
 
@@ -62,7 +60,6 @@ class ReverseGeocoder : public std::enable_shared_from_this<ReverseGeocoder> {
   const std::string serverUrl_;
   WebClient& webClient_;
   const Now now_;
-  const std::function<void(const std::string&)> found_;
   const std::chrono::milliseconds pace_;
   Gazetteer gazetteer_;
   std::chrono::nanoseconds nextTurn_{std::chrono::nanoseconds::min()};

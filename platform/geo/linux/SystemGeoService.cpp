@@ -78,11 +78,9 @@ class SystemGeoService::IpTicket final : public GeoIpTicket {
 
 SystemGeoService::SystemGeoService(WorkQueues& queues, WebClient& webClient, Settings settings)
     : queues_(queues),
-      country_(std::make_shared<CountryConfiguration>(std::move(settings.countryFiles))),
       geocoder_(std::make_shared<ReverseGeocoder>(
           std::move(settings.geocoderUrl), std::move(settings.gazetteer), webClient,
-          [] { return std::chrono::nanoseconds(std::chrono::steady_clock::now().time_since_epoch()); },
-          [country = country_](const std::string& code) { country->setLastGeocoded(code); })),
+          [] { return std::chrono::nanoseconds(std::chrono::steady_clock::now().time_since_epoch()); })),
       stunServer_(std::move(settings.stunServer)) {}
 
 SystemGeoService::~SystemGeoService() {
@@ -126,7 +124,5 @@ std::unique_ptr<ReverseGeocodeTicket> SystemGeoService::makeReverseGeocodeTicket
 std::unique_ptr<GeoIpTicket> SystemGeoService::makeGeoIpTicket(const std::optional<std::string>& ipAddress) {
   return std::make_unique<IpTicket>(*this, !ipAddress.has_value());
 }
-
-std::optional<std::string> SystemGeoService::currentCountryCode() { return country_->countryCode(); }
 
 }  // namespace brenvik

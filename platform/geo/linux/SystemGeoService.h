@@ -9,7 +9,6 @@
 
 #include "platform/base/UniqueFd.h"
 #include "platform/geo/GeoService.h"
-#include "platform/geo/linux/CountryConfiguration.h"
 #include "platform/geo/linux/ReverseGeocoder.h"
 #include "platform/runloop/WorkQueue.h"
 #include "platform/web/WebClient.h"
@@ -18,16 +17,15 @@ namespace brenvik {
 
 class PublicAddressFinder;
 
-// The geo service on Linux: addresses from a server or the offline gazetteer, the public address by STUN, the
-// country configuration from its file. Queues of its own do the work, each made with the first question that
-// needs it: one for places, one for each transaction that runs at a time.
-class SystemGeoService final : public GeoService {
+// The geo service's look-ups on Linux: addresses from a server or the offline gazetteer, the public address
+// by STUN. Queues of its own do the work, each made with the first question that needs it: one for places,
+// one for each transaction that runs at a time.
+class SystemGeoService final : public GeoTickets {
  public:
   struct Settings {
     std::string geocoderUrl;  // empty: none
     std::string gazetteer;    // path of the offline database
     std::string stunServer;   // host or host:port
-    CountryConfiguration::Files countryFiles;
   };
 
   // The references outlive this object; the web client is used only when there is a geocoder. Cheap: opens
@@ -42,7 +40,6 @@ class SystemGeoService final : public GeoService {
                                                                  ShiftLocations shiftLocations,
                                                                  const GeoTraits* traits) override;
   std::unique_ptr<GeoIpTicket> makeGeoIpTicket(const std::optional<std::string>& ipAddress) override;
-  std::optional<std::string> currentCountryCode() override;
 
  private:
   class ReverseTicket;
@@ -53,7 +50,6 @@ class SystemGeoService final : public GeoService {
   std::shared_ptr<PublicAddressFinder> addressFinder();
 
   WorkQueues& queues_;
-  const std::shared_ptr<CountryConfiguration> country_;
   const std::shared_ptr<ReverseGeocoder> geocoder_;
   const std::string stunServer_;
   std::mutex mutex_;

@@ -52,15 +52,11 @@ struct SilentServer {
 
 class SystemGeoServiceTest : public testing::Test {
  protected:
-  SystemGeoServiceTest() {
-    settings.countryFiles = {"/nonexistent", "/nonexistent", "/nonexistent", "/nonexistent"};
-  }
-
   RecordingLog log;
   std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
   SystemQueues queues{*loop};
   ScriptedWebClient web;
-  SystemGeoService::Settings settings{"", GAZETTEER_DATABASE, "127.0.0.1:9", {}};
+  SystemGeoService::Settings settings{"", GAZETTEER_DATABASE, "127.0.0.1:9"};
   std::shared_ptr<WorkQueue> handlers = queues.makeSerial("handlers", QualityOfService::standard);
 };
 
@@ -97,16 +93,6 @@ TEST_F(SystemGeoServiceTest, NeverAnswersFromWithinSubmit) {
     *done = submitted;
   });
   EXPECT_TRUE(answered.get_future().get());
-}
-
-TEST_F(SystemGeoServiceTest, TheCountryOfTheLastAnswerIsTheConfiguredOneWhenThereIsNoFile) {
-  SystemGeoService service(queues, web, settings);
-  EXPECT_EQ(service.currentCountryCode(), std::nullopt);
-  std::promise<void> answered;
-  service.makeReverseGeocodeTicket({48.8584, 2.2945}, IncludeEta::no, ShiftLocations::ifNeeded, nullptr)
-      ->submit([&](const auto&, const auto&) { answered.set_value(); }, nullptr, handlers);
-  answered.get_future().wait();
-  EXPECT_EQ(service.currentCountryCode(), "FR");
 }
 
 TEST_F(SystemGeoServiceTest, APublicAddressThatCannotBeHadIsAnError) {

@@ -2,9 +2,11 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/gzip/linux/ZlibGunzip.h"
 
+#include <unistd.h>
 #include <zlib.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <limits>
 #include <memory>
 #include <new>
@@ -19,6 +21,18 @@ constexpr int kGzipWrapper = 15 + 16;  // largest window, gzip header and traile
 struct InflateEnd {
   void operator()(z_stream* stream) const noexcept { (void)::inflateEnd(stream); }
 };
+
+// 0, or the number of the error.
+int writeAll(int file, std::span<const std::byte> bytes) noexcept {
+  while (!bytes.empty()) {
+    const auto written = ::write(file, bytes.data(), bytes.size());
+    if (written < 0 && errno == EINTR) continue;
+    if (written < 0) return errno;
+    if (written == 0) return EIO;
+    bytes = bytes.subspan(static_cast<std::size_t>(written));
+  }
+  return 0;
+}
 
 uInt clamped(std::size_t size) noexcept {
   return static_cast<uInt>(std::min<std::size_t>(size, std::numeric_limits<uInt>::max()));
@@ -60,6 +74,25 @@ GunzipResult ZlibGunzip::gunzip(std::span<const std::byte> input, std::uint64_t 
   }
 } catch (...) {
   return GunzipResult::outOfMemory;
+}
+
+GunzipOutcome ZlibGunzip::gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
+                                     std::uint64_t largestOutput) noexcept {
+  return gunzipInto(input, file, room, largestOutput, nullptr);
+}
+
+GunzipOutcome ZlibGunzip::gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
+                                     std::uint64_t largestOutput,
+                                     const std::function<bool()>& mayGoOn) noexcept try {
+  GunzipOutcome outcome;
+  outcome.result = gunzip(input.bytes, largestOutput, [&](std::span<const std::byte> output) {
+    outcome.size += output.size();
+    if (outcome.size <= room) outcome.writeError = writeAll(file, output);
+    return outcome.writeError == 0 && (!mayGoOn || mayGoOn());
+  });
+  return outcome;
+} catch (...) {
+  return {GunzipResult::outOfMemory, 0, 0};
 }
 
 }  // namespace brenvik

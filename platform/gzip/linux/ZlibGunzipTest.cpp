@@ -2,12 +2,19 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/gzip/linux/ZlibGunzip.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/mman.h>
+#include <unistd.h>
 #include <zlib.h>
 
+#include <algorithm>
+#include <cerrno>
 #include <limits>
 #include <string>
 #include <vector>
+
+#include "platform/base/UniqueFd.h"
 
 namespace brenvik {
 namespace {
@@ -117,6 +124,46 @@ TEST_F(ZlibGunzipTest, OutputStopsAtTheLimitOverAllMembers) {
 TEST_F(ZlibGunzipTest, AReceiverThatSaysNoEndsTheWork) {
   refuseBeyond = 600'000;
   EXPECT_EQ(run(gzip(text(1'000'000))), GunzipResult::refused);
+}
+
+// ---- into a file ----
+
+class GunzipIntoTest : public ZlibGunzipTest {
+ protected:
+  GunzipOutcome into(const std::string& input, std::uint64_t room, std::uint64_t largest = kNoLimit) {
+    return gunzip.gunzipInto({std::as_bytes(std::span(input))}, file.get(), room, largest);
+  }
+  std::string written() {
+    std::string content(2'000'000, '\0');
+    const auto size = ::pread(file.get(), content.data(), content.size(), 0);
+    content.resize(static_cast<std::size_t>(std::max<ssize_t>(size, 0)));
+    return content;
+  }
+  UniqueFd file{::memfd_create("gunzip test", MFD_CLOEXEC)};
+};
+
+TEST_F(GunzipIntoTest, TheOutputIsWrittenAndCounted) {
+  const std::string original = text(1'000'000);
+  const auto outcome = into(gzip(original), 1'000'000);
+  EXPECT_EQ(outcome.result, GunzipResult::whole);
+  EXPECT_EQ(outcome.size, original.size());
+  EXPECT_EQ(outcome.writeError, 0);
+  EXPECT_TRUE(written() == original);
+}
+
+TEST_F(GunzipIntoTest, WhatGoesBeyondTheRoomIsCountedAndNotWritten) {
+  const auto outcome = into(gzip(text(1'000'000)), 500'000);
+  EXPECT_EQ(outcome.result, GunzipResult::whole);
+  EXPECT_EQ(outcome.size, 1'000'000U);
+  EXPECT_LE(written().size(), 500'000U);
+  EXPECT_EQ(into(gzip(text(1'000'000)), 500'000, 999'999).result, GunzipResult::tooLarge);
+}
+
+TEST_F(GunzipIntoTest, AWriteThatFailsEndsTheWorkWithItsError) {
+  file.reset(::open("/dev/full", O_WRONLY | O_CLOEXEC));
+  const auto outcome = into(gzip(text(1'000'000)), kNoLimit);
+  EXPECT_EQ(outcome.result, GunzipResult::refused);
+  EXPECT_EQ(outcome.writeError, ENOSPC);
 }
 
 }  // namespace

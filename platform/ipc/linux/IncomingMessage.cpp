@@ -2,24 +2,17 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/ipc/linux/IncomingMessage.h"
 
-#include <fcntl.h>
 #include <sys/mman.h>
-#include <sys/stat.h>
-#include <sys/vfs.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 
+#include "platform/base/SealedMemory.h"
 #include "platform/ipc/linux/DescriptorWalk.h"
 
 namespace brenvik {
 namespace {
-
-constexpr int kNeededSeals = F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE;
-
-// linux/magic.h. Memory of huge pages has seals, too, but is mapped and unmapped in other units.
-constexpr auto kOrdinaryMemory = 0x01021994;
 
 bool isPortSocket(int fd) noexcept {
   int domain = AF_UNSPEC;
@@ -92,16 +85,9 @@ IncomingMessage::Received IncomingMessage::receive(int fd, int flags, std::size_
 }
 
 KernelReturn IncomingMessage::mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept {
-  const int seals = ::fcntl(fd, F_GET_SEALS);
-  if (seals < 0 || (seals & kNeededSeals) != kNeededSeals) return mig::badArguments;
-  struct stat status {};
-  (void)::fstat(fd, &status);  // a descriptor with seals has a size
-  if (status.st_size < static_cast<off_t>(length)) return mig::badArguments;
-  struct statfs system {};
-  if (::fstatfs(fd, &system) != 0 || system.f_type != kOrdinaryMemory) return mig::badArguments;
-  // Private: before Linux 6.7 a shared mapping of memory sealed against writing is refused, even for reading.
-  void* const mapped = ::mmap(nullptr, length, PROT_READ, MAP_PRIVATE, fd, 0);
-  if (mapped == MAP_FAILED) return kern::resourceShortage;
+  if (sizeOfSealedMemory(fd) < static_cast<std::int64_t>(length)) return mig::badArguments;
+  void* const mapped = mapSealedMemory(fd, length);
+  if (mapped == nullptr) return kern::resourceShortage;
   mappings_[mappingCount_++] = {mapped, length};
   *address = reinterpret_cast<std::uint64_t>(mapped);
   return kern::success;

@@ -11,19 +11,16 @@
 #include <sys/un.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
-#include <charconv>
 #include <chrono>
-#include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <optional>
-#include <string_view>
 #include <system_error>
 #include <thread>
 #include <vector>
 
+#include "platform/ipc/linux/ServiceManagerSocket.h"
 #include "platform/log/Log.h"
 
 namespace brenvik {
@@ -40,15 +37,6 @@ bool isAlive(const sockaddr_un& address) noexcept {
   const UniqueFd probe(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
   if (::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0) return true;
   return errno != ECONNREFUSED && errno != ENOENT;
-}
-
-bool isListeningPort(int fd) noexcept {
-  const auto has = [fd](int option, int wanted) {
-    int value = -1;
-    socklen_t size = sizeof value;
-    return ::getsockopt(fd, SOL_SOCKET, option, &value, &size) == 0 && value == wanted;
-  };
-  return has(SO_DOMAIN, AF_UNIX) && has(SO_TYPE, SOCK_SEQPACKET) && has(SO_ACCEPTCONN, 1);
 }
 
 // The group's number; root's when there is no such group. Nothing when that cannot be found out.
@@ -81,59 +69,7 @@ bool lockWithin(int fd) noexcept {
   return false;
 }
 
-// sd_listen_fds(3) tells how a service manager hands over sockets: descriptors from 3 on, for the process
-// that LISTEN_PID names, as many as LISTEN_FDS says, with names between colons in LISTEN_FDNAMES. The
-// library's own function took 20 us of a start, most of it pages of the library that nothing else at the
-// start needs.
-constexpr int kFirstListenDescriptor = 3;
-struct ListenDescriptors {
-  int count = 0;
-  std::string names;
-};
-
-int numberIn(const char* variable) noexcept {
-  const char* const text = std::getenv(variable);
-  if (text == nullptr) return 0;
-  const char* const end = text + std::strlen(text);
-  int number = 0;
-  const auto [stopped, error] = std::from_chars(text, end, number);
-  return error == std::errc() && stopped == end ? number : 0;
-}
-
-// Once: the variables are gone afterwards, for programs that are started from here.
-ListenDescriptors takeListenDescriptors() {
-  ListenDescriptors given;
-  if (numberIn("LISTEN_PID") == ::getpid()) {
-    given.count = std::max(numberIn("LISTEN_FDS"), 0);
-    if (const char* const names = std::getenv("LISTEN_FDNAMES")) given.names = names;
-  }
-  for (const char* const variable : {"LISTEN_PID", "LISTEN_FDS", "LISTEN_FDNAMES"}) ::unsetenv(variable);
-  return given;
-}
-
 }  // namespace
-
-UniqueFd SystemBootstrap::fromServiceManager(const char* serviceName) {
-  const ListenDescriptors given = takeListenDescriptors();
-  std::string_view names = given.names;
-  UniqueFd chosen;
-  for (int i = 0; i < given.count; ++i) {
-    // More were promised than are open: the rest was never ours.
-    if (::fcntl(kFirstListenDescriptor + i, F_SETFD, FD_CLOEXEC) != 0) break;
-    UniqueFd descriptor(kFirstListenDescriptor + i);
-    const std::string name(names.substr(0, names.find(':')));
-    names.remove_prefix(std::min(name.size() + 1, names.size()));
-    if (name != serviceName || chosen.isValid()) {
-      logUnified(LogLevel::error, "passed over a listening descriptor named \"%s\"", name.c_str());
-    } else if (!isListeningPort(descriptor.get())) {
-      logUnified(LogLevel::error, "the descriptor named \"%s\" is no listening SOCK_SEQPACKET socket",
-                 serviceName);
-    } else {
-      chosen = std::move(descriptor);
-    }
-  }
-  return chosen;
-}
 
 // Nobody but its owner may connect before this: bind(2) leaves out what the umask does, and the umask is 022.
 bool SystemBootstrap::openToGroup(const std::string& path) const {
@@ -189,7 +125,7 @@ KernelReturn SystemBootstrap::checkIn(const char* serviceName, PortName* receive
   *receiveRight = kNullPort;
   try {
     std::string path;
-    UniqueFd socket = fromServiceManager(serviceName);
+    UniqueFd socket = takeServiceManagerSocket(serviceName);
     if (!socket.isValid()) {
       path = directory_ + "/" + serviceName;
       socket = listenAt(path, serviceName);

@@ -22,7 +22,6 @@ class SystemBootstrap final : public Bootstrap {
   KernelReturn checkIn(const char* serviceName, PortName* receiveRight) noexcept override;
 
  private:
-  UniqueFd fromServiceManager(const char* serviceName);
   UniqueFd listenAt(const std::string& path, const char* serviceName);
   bool openToGroup(const std::string& path) const;
 

@@ -10,6 +10,8 @@
 #include <cstdlib>
 #include <new>
 
+#include "platform/base/SealedMemory.h"
+
 namespace brenvik {
 
 namespace {
@@ -67,8 +69,7 @@ UniqueFd SystemRegions::sealIntoDescriptor(void* address, std::size_t length) no
   large_.erase(region);
   // The seal against writing is refused while a writable mapping stands.
   ::munmap(address, length);
-  if (::fcntl(memfd.get(), F_ADD_SEALS, F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE | F_SEAL_SEAL) != 0)
-    return {};
+  if (!sealAgainstChange(memfd.get())) return {};
   return memfd;
 }
 

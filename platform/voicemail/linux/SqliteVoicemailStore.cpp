@@ -4,12 +4,8 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <cerrno>
-#include <cstdio>
-#include <cstdlib>
-#include <memory>
 #include <new>
 
 #include "platform/base/ErrorText.h"
@@ -17,6 +13,7 @@
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/sqlite/ForeignDatabase.h"
+#include "platform/sqlite/HeldFolder.h"
 
 namespace brenvik {
 namespace {
@@ -25,7 +22,6 @@ namespace {
 constexpr int kMostMovedAside = 100;
 
 constexpr const char* kFile = "voicemail.db";
-constexpr const char* kFolderInTheMaking = ".brenvik-folder";
 
 constexpr const char* kSchema =
     "CREATE TABLE IF NOT EXISTS general(id INTEGER PRIMARY KEY CHECK(id = 0), token TEXT NOT NULL);"
@@ -36,35 +32,25 @@ bool isDamage(int code) {
   return primary == SQLITE_NOTADB || primary == SQLITE_CORRUPT;
 }
 
-// Makes the directory below another one for the account, unless it is there. Never follows a link: the
-// account's own directories are its user's to rearrange.
-UniqueFd enterDirectory(int parent, const char* name, mode_t mode, uid_t uid, gid_t gid, bool create) {
-  constexpr int kFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-  UniqueFd fd(::openat(parent, name, kFlags));
-  if (fd.isValid() || errno != ENOENT || !create) return fd;
-  // Under another name until it is the account's: killed in between, a helper would leave the account a
-  // folder that it may not enter. One left so is used.
-  if (::mkdirat(parent, kFolderInTheMaking, 0700) != 0 && errno != EEXIST) return {};
-  fd.reset(::openat(parent, kFolderInTheMaking, kFlags));
-  if (!fd.isValid() || ::fchown(fd.get(), uid, gid) != 0 || ::fchmod(fd.get(), mode) != 0 ||
-      ::renameat(parent, kFolderInTheMaking, parent, name) != 0) {
-    (void)::unlinkat(parent, kFolderInTheMaking, AT_REMOVEDIR);  // the next attempt copes with what stays
-    return {};
-  }
-  // Or a power cut takes the folder with the tokens in it. The next attempt makes it again.
-  if (::fsync(parent) != 0) {
-    (void)::unlinkat(parent, name, AT_REMOVEDIR);
-    return {};
-  }
-  return fd;
-}
-
 }  // namespace
+
+// Which file it is, of all that are there now.
+struct SqliteVoicemailStore::Identity {
+  dev_t device = 0;
+  ino_t inode = 0;
+  static Identity of(const struct stat& info) { return {info.st_dev, info.st_ino}; }
+  bool operator==(const Identity&) const = default;
+};
 
 // One opened database.
 class SqliteVoicemailStore::Database {
  public:
-  // SQLITE_OK or SQLite's extended code. The limit outlives the object.
+  UniqueFd folder;  // by which SQLite finds the journal, too
+  // Which folder and which file they are. Nobody else's as long as they are open.
+  Identity folderIs;
+  Identity fileIs;
+
+  // SQLITE_OK or SQLite's extended code.
   int open(const std::string& file, SqliteTimeLimit& limit) {
     bool lackedMemory = false;
     if (sqlite(&lackedMemory) == nullptr) return lackedMemory ? SQLITE_NOMEM : SQLITE_CANTOPEN;
@@ -80,6 +66,22 @@ class SqliteVoicemailStore::Database {
     sqlite()->db_config(opened, SQLITE_DBCONFIG_ENABLE_TRIGGER, 0, nullptr);
     sqlite()->db_config(opened, SQLITE_DBCONFIG_ENABLE_VIEW, 0, nullptr);
     limit.applyTo(opened);
+    const int failed = prepare();
+    SqliteTimeLimit::lift(opened);
+    return failed;
+  }
+
+  // Runs one statement within the limit.
+  int run(SqliteTimeLimit& limit, const char* statement, const std::string* first, const std::string* second,
+          std::optional<std::string>* result) {
+    limit.applyTo(handle_.get());
+    const int code = run(statement, first, second, result);
+    SqliteTimeLimit::lift(handle_.get());
+    return code;
+  }
+
+ private:
+  int prepare() {
     // EXTRA: the folder is synced as well when the journal goes, or a power cut could bring the journal back,
     // and with it the state before a change that was answered.
     const int failed = execute("PRAGMA journal_mode=DELETE; PRAGMA synchronous=EXTRA;");
@@ -90,7 +92,7 @@ class SqliteVoicemailStore::Database {
     return sqlite()->exec(handle_.get(), statements, nullptr, nullptr, nullptr);
   }
 
-  // Runs one statement with up to two texts bound; *result gets the first column of the first row, if any.
+  // With up to two texts bound; *result gets the first column of the first row, if any.
   int run(const char* statement, const std::string* first, const std::string* second,
           std::optional<std::string>* result) {
     sqlite3_stmt* prepared = nullptr;
@@ -114,49 +116,77 @@ class SqliteVoicemailStore::Database {
     return code == SQLITE_ROW || code == SQLITE_DONE ? SQLITE_OK : code;
   }
 
- private:
   SqliteDatabase handle_;
 };
 
+SqliteVoicemailStore::SqliteVoicemailStore(Folder folder, SqliteTime time)
+    : folder_(std::move(folder)), time_(std::move(time)) {}
+
+SqliteVoicemailStore::~SqliteVoicemailStore() = default;
+
 // Where the database is.
 struct SqliteVoicemailStore::Place {
-  UniqueFd folder;
-  std::string file;  // its path
+  int folder = -1;
+  Identity folderIs;
+  Identity fileIs;
 };
 
-// Makes the folders and the empty file, each with its owner and mode. SQLite refuses a path with a link in
-// it, so links above the home are resolved first.
-SqliteVoicemailStore::Found SqliteVoicemailStore::find(Place* place, IfMissing ifMissing) {
+// Makes the empty file with its mode.
+SqliteVoicemailStore::Found SqliteVoicemailStore::find(Place* place, Purpose purpose) {
   const auto missing = [] { return errno == ENOENT ? Found::nothing : Found::unusable; };
-  const Account account = account_();
-  if (account.home.empty()) return Found::nothing;
-  const std::unique_ptr<char, decltype(&std::free)> home(::realpath(account.home.c_str(), nullptr),
-                                                         &std::free);
-  if (!home && errno == ENOMEM) throw std::bad_alloc();
-  if (!home) return missing();
-  const bool create = ifMissing == IfMissing::create;
-  const UniqueFd top(::open(home.get(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-  if (!top.isValid()) return missing();
-  const UniqueFd library = enterDirectory(top.get(), "Library", 0755, account.uid, account.gid, create);
-  if (!library.isValid()) return missing();
-  place->folder = enterDirectory(library.get(), "Voicemail", 0700, account.uid, account.gid, create);
-  if (!place->folder.isValid()) return missing();
-  const int folder = place->folder.get();
+  place->folder = folder_(purpose);
+  if (place->folder < 0) return missing();
+  const int folder = place->folder;
+  struct stat info {};
+  if (::fstat(folder, &info) != 0) return Found::unusable;
+  place->folderIs = Identity::of(info);
+  if (database_ != nullptr && place->folderIs == database_->folderIs &&
+      ::fstatat(folder, kFile, &info, AT_SYMLINK_NOFOLLOW) == 0 && Identity::of(info) == database_->fileIs &&
+      info.st_mode == (S_IFREG | 0600)) {
+    place->fileIs = database_->fileIs;
+    return Found::database;
+  }
+  // Closed before the file is looked at: closing any descriptor of a file gives up the process's locks on it.
+  database_.reset();
   UniqueFd database(::openat(folder, kFile, O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-  if (!database.isValid() && errno == ENOENT && create) {
+  if (!database.isValid() && errno == ENOENT && purpose == Purpose::writing) {
     database.reset(::openat(folder, kFile, O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   }
   if (!database.isValid()) return missing();
-  struct stat info {};
   if (::fstat(database.get(), &info) != 0 || !S_ISREG(info.st_mode)) return Found::unusable;
-  // The journal takes its owner and mode from the database. Of a name elsewhere nothing is given away.
-  if ((info.st_uid != account.uid || info.st_gid != account.gid) && info.st_nlink == 1 &&
-      ::fchown(database.get(), account.uid, account.gid) != 0) {
-    return Found::unusable;
-  }
   if ((info.st_mode & 07777) != 0600 && ::fchmod(database.get(), 0600) != 0) return Found::unusable;
-  place->file = std::string(home.get()) + "/Library/Voicemail/" + kFile;
+  place->fileIs = Identity::of(info);
   return Found::database;
+}
+
+int SqliteVoicemailStore::open(const Place& place, SqliteTimeLimit& limit) {
+  database_ = std::make_unique<Database>();
+  database_->folderIs = place.folderIs;
+  database_->fileIs = place.fileIs;
+  database_->folder.reset(::fcntl(place.folder, F_DUPFD_CLOEXEC, 0));
+  const int code = database_->folder.isValid()
+                       ? database_->open(pathInHeldFolder(database_->folder.get(), kFile), limit)
+                       : SQLITE_CANTOPEN;
+  if (code != SQLITE_OK) database_.reset();
+  return code;
+}
+
+// A database that is open already may have been changed below (its tables dropped, its bytes written over),
+// so a failure counts only with one that was opened for this operation.
+int SqliteVoicemailStore::run(const Place& place, SqliteTimeLimit& limit, const char* statement,
+                              const std::string* first, const std::string* second,
+                              std::optional<std::string>* result) {
+  int code = SQLITE_OK;
+  if (database_ != nullptr) {
+    code = database_->run(limit, statement, first, second, result);
+    if (code == SQLITE_OK) return code;
+    database_.reset();
+    if (limit.isOver()) return code;
+  }
+  code = open(place, limit);
+  if (code == SQLITE_OK) code = database_->run(limit, statement, first, second, result);
+  if (code != SQLITE_OK) database_.reset();
+  return code;
 }
 
 // Nothing in it can be read any more; a person may still want to look at it, so an earlier one stays, too.
@@ -165,7 +195,7 @@ bool SqliteVoicemailStore::moveAside(const Place& place) {
   for (int number = 0; number < kMostMovedAside; ++number) {
     std::string name = std::string(kFile) + ".damaged";
     if (number > 0) name += "." + std::to_string(number);
-    if (renameToFreeName(place.folder.get(), kFile, name.c_str()) == 0) {
+    if (renameToFreeName(place.folder, kFile, name.c_str()) == 0) {
       logUnified(LogLevel::error, "The voicemail store is damaged; moved aside to %s", name.c_str());
       return true;
     }
@@ -184,12 +214,8 @@ bool SqliteVoicemailStore::write(const char* statement, const std::string* first
     SqliteTimeLimit limit(kPatience, time_);
     for (int attempt = 0; attempt < 2; ++attempt) {
       Place place;
-      if (find(&place, IfMissing::create) != Found::database) break;
-      {
-        Database database;
-        code = database.open(place.file, limit);
-        if (code == SQLITE_OK) code = database.run(statement, first, second, nullptr);
-      }
+      if (find(&place, Purpose::writing) != Found::database) break;
+      code = run(place, limit, statement, first, second, nullptr);
       if (!isDamage(code) || !moveAside(place)) break;
     }
   } catch (const std::bad_alloc&) {
@@ -206,13 +232,9 @@ bool SqliteVoicemailStore::read(const char* statement, const std::string* key,
   try {
     SqliteTimeLimit limit(kPatience, time_);
     Place place;
-    const Found found = find(&place, IfMissing::fail);
+    const Found found = find(&place, Purpose::reading);
     if (found == Found::nothing) return true;
-    if (found == Found::database) {
-      Database database;
-      code = database.open(place.file, limit);
-      if (code == SQLITE_OK) code = database.run(statement, key, nullptr, token);
-    }
+    if (found == Found::database) code = run(place, limit, statement, key, nullptr, token);
   } catch (const std::bad_alloc&) {
     code = SQLITE_NOMEM;
   }

@@ -2,10 +2,9 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
-#include <sys/types.h>
-
 #include <chrono>
 #include <functional>
+#include <memory>
 #include <optional>
 #include <string>
 #include <utility>
@@ -15,29 +14,26 @@
 
 namespace brenvik {
 
-// The tokens in an SQLite database, <home>/Library/Voicemail/voicemail.db, made on first use and owned by the
-// account. It is opened for each operation, so that an idle helper keeps neither it nor its lock. A database
-// that is damaged is moved aside, to voicemail.db.damaged or, where there is one already, to
-// voicemail.db.damaged.1 and so on, and a new one made.
+class SqliteTimeLimit;
+
+// The tokens in an SQLite database, voicemail.db, which the first change makes. It is opened for each
+// operation, so that an idle process keeps neither it nor its lock. A database that is damaged is moved
+// aside, to voicemail.db.damaged or, where there is one already, to voicemail.db.damaged.1 and so on, and a
+// new one made. Without any right but the account's own: what it may not use is a store that cannot be
+// opened.
 class SqliteVoicemailStore final : public VoicemailStore {
  public:
-  struct Account {
-    std::string home;  // empty: the account has none, and the store is always empty
-    uid_t uid;
-    gid_t gid;
-  };
+  enum class Purpose { reading, writing };
 
   // How long one operation may wait for other processes and run statements. A request has two at most, and
   // three seconds with what the disk takes.
   static constexpr std::chrono::milliseconds kPatience{1000};
 
-  // `account` is asked by each operation, so that nothing is looked up before the first; it may throw
-  // std::bad_alloc.
-  explicit SqliteVoicemailStore(std::function<Account()> account, SqliteTime time = SqliteTime::ofTheSystem())
-      : account_(std::move(account)), time_(std::move(time)) {}
-  SqliteVoicemailStore(std::string home, uid_t uid, gid_t gid, SqliteTime time = SqliteTime::ofTheSystem())
-      : SqliteVoicemailStore([account = Account{std::move(home), uid, gid}] { return account; },
-                             std::move(time)) {}
+  // `folder` gives the descriptor of its folder for each operation, which it keeps open; -1 with ENOENT:
+  // there is none yet, and the store is empty. It may throw std::bad_alloc.
+  using Folder = std::function<int(Purpose)>;
+  explicit SqliteVoicemailStore(Folder folder, SqliteTime time = SqliteTime::ofTheSystem());
+  ~SqliteVoicemailStore() override;
 
   bool setToken(const std::string* token) noexcept override;
   bool setTokenForKey(const std::string& key, const std::string& token) noexcept override;
@@ -47,17 +43,21 @@ class SqliteVoicemailStore final : public VoicemailStore {
 
  private:
   class Database;
+  struct Identity;
   struct Place;
-  enum class IfMissing { fail, create };
   enum class Found { database, nothing, unusable };
 
-  Found find(Place* place, IfMissing ifMissing);
+  Found find(Place* place, Purpose purpose);
+  int open(const Place& place, SqliteTimeLimit& limit);
+  int run(const Place& place, SqliteTimeLimit& limit, const char* statement, const std::string* first,
+          const std::string* second, std::optional<std::string>* result);
   static bool moveAside(const Place& place);
   bool write(const char* statement, const std::string* first, const std::string* second) noexcept;
   bool read(const char* statement, const std::string* key, std::optional<std::string>* token) noexcept;
 
-  const std::function<Account()> account_;
+  const Folder folder_;
   const SqliteTime time_;
+  std::unique_ptr<Database> database_;  // open, or null
 };
 
 }  // namespace brenvik

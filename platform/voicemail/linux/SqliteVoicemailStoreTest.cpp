@@ -11,6 +11,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <chrono>
 #include <memory>
 #include <optional>
@@ -22,6 +23,7 @@
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/sqlite/fakes/ManualSqliteTime.h"
+#include "platform/stores/linux/PreparedFolder.h"
 #include "platform/voicemail/fakes/InMemoryVoicemailStore.h"
 #include "platform/voicemail/linux/DynamicVisualVoicemail.h"
 
@@ -35,12 +37,44 @@ namespace {
 
 using namespace std::chrono_literals;
 
+// In <home>/Library/Voicemail, as it comes about for the account when it is first written to.
+class StoreAtHome final : public VoicemailStore {
+ public:
+  StoreAtHome(const std::string& home, uid_t uid, gid_t gid,
+              const SqliteTime& time = SqliteTime::ofTheSystem())
+      : folder_([account = PreparedFolder::Account{home, uid, gid}] { return account; }, "Voicemail",
+                "voicemail.db"),
+        store_(
+            [this](SqliteVoicemailStore::Purpose purpose) {
+              const bool writes = purpose == SqliteVoicemailStore::Purpose::writing;
+              const auto state = folder_.open(
+                  writes ? StoreFolder::IfMissing::create : StoreFolder::IfMissing::fail, &opened_);
+              errno = state == StoreFolder::State::missing ? ENOENT : EACCES;
+              return state == StoreFolder::State::open ? opened_.descriptor.get() : -1;
+            },
+            time) {}
+  bool setToken(const std::string* token) noexcept override { return store_.setToken(token); }
+  bool setTokenForKey(const std::string& key, const std::string& token) noexcept override {
+    return store_.setTokenForKey(key, token);
+  }
+  bool removeAllRecords() noexcept override { return store_.removeAllRecords(); }
+  bool readToken(std::optional<std::string>* token) noexcept override { return store_.readToken(token); }
+  bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept override {
+    return store_.readTokenForKey(key, token);
+  }
+
+ private:
+  PreparedFolder folder_;
+  StoreFolder::Opened opened_;
+  SqliteVoicemailStore store_;
+};
+
 // ---- what every store does
 
 struct SqliteAtHome {
   TemporaryDirectory home;
   std::unique_ptr<VoicemailStore> make() {
-    return std::make_unique<SqliteVoicemailStore>(home.path(), ::getuid(), ::getgid());
+    return std::make_unique<StoreAtHome>(home.path(), ::getuid(), ::getgid());
   }
 };
 struct InMemory {
@@ -97,7 +131,7 @@ class SqliteVoicemailStoreTest : public testing::Test {
  protected:
   TemporaryDirectory home;
   std::string file = home / "Library/Voicemail/voicemail.db";
-  SqliteVoicemailStore store{home.path(), ::getuid(), ::getgid()};
+  StoreAtHome store{home.path(), ::getuid(), ::getgid()};
   const std::string token = "token";
 
   static RecordingLog::Entry errorLine(const std::string& text) {
@@ -118,34 +152,20 @@ TEST_F(SqliteVoicemailStoreTest, ReadingMakesNothingAndWritingMakesAPrivateFileO
   const uid_t owner = ::geteuid() == 0 ? 4711 : ::getuid();
   const gid_t group = ::geteuid() == 0 ? 4712 : ::getgid();
   const mode_t before = ::umask(0);
-  SqliteVoicemailStore of(home.path(), owner, group);
+  StoreAtHome of(home.path(), owner, group);
   of.setToken(&token);
   ::umask(before);
   EXPECT_EQ(of.copyToken(), token);
   EXPECT_EQ(statOf(file).st_mode, S_IFREG | 0600u);
-  EXPECT_EQ(statOf(file).st_uid, owner);
-  EXPECT_EQ(statOf(file).st_gid, group);
   EXPECT_EQ(statOf(home / "Library/Voicemail").st_mode, S_IFDIR | 0700u);
   EXPECT_EQ(statOf(home / "Library/Voicemail").st_uid, owner);
   EXPECT_EQ(statOf(home / "Library").st_mode, S_IFDIR | 0755u);
 }
 
-TEST_F(SqliteVoicemailStoreTest, AFolderThatAKilledProcessLeftHalfMadeIsFinished) {
-  ASSERT_EQ(::mkdir((home / ".brenvik-folder").c_str(), 0700), 0);
-  home.directory("Library/.brenvik-folder");
-  const uid_t owner = ::geteuid() == 0 ? 4711 : ::getuid();
-  SqliteVoicemailStore of(home.path(), owner, ::getgid());
-  of.setToken(&token);
-  EXPECT_EQ(of.copyToken(), token);
-  EXPECT_EQ(statOf(home / "Library/Voicemail").st_mode, S_IFDIR | 0700u);
-  EXPECT_EQ(statOf(home / "Library/Voicemail").st_uid, owner);
-  EXPECT_FALSE(isThere(home / "Library/.brenvik-folder"));
-}
-
 TEST_F(SqliteVoicemailStoreTest, KilledWhileItMakesItsFoldersItNeverShowsOneTheAccountMayNotEnter) {
   const uid_t owner = ::geteuid() == 0 ? 4711 : ::getuid();
   const gid_t group = ::geteuid() == 0 ? 4712 : ::getgid();
-  SqliteVoicemailStore of(home.path(), owner, group);
+  StoreAtHome of(home.path(), owner, group);
   for (int round = 0; round < 60; ++round) {
     const pid_t child = ::fork();
     if (child == 0) {
@@ -165,21 +185,47 @@ TEST_F(SqliteVoicemailStoreTest, KilledWhileItMakesItsFoldersItNeverShowsOneTheA
 
 TEST_F(SqliteVoicemailStoreTest, AnotherObjectSeesWhatWasSet) {
   store.setToken(&token);
-  SqliteVoicemailStore second(home.path(), ::getuid(), ::getgid());
+  StoreAtHome second(home.path(), ::getuid(), ::getgid());
   EXPECT_EQ(second.copyToken(), token);
 }
 
 TEST_F(SqliteVoicemailStoreTest, AHomeBehindALinkIsTheSameHome) {
   TemporaryDirectory other;
-  SqliteVoicemailStore linked(other.link("home", home.path()), ::getuid(), ::getgid());
+  StoreAtHome linked(other.link("home", home.path()), ::getuid(), ::getgid());
   linked.setToken(&token);
   EXPECT_EQ(store.copyToken(), token);
+}
+
+TEST_F(SqliteVoicemailStoreTest, WhatStandsInItsPlaceNowIsWhatCounts) {
+  store.setToken(&token);
+  StoreAtHome other(home / "other", ::getuid(), ::getgid());
+  home.directory("other");
+  const std::string theirs = "theirs";
+  other.setToken(&theirs);
+  const std::string otherFile = home / "other/Library/Voicemail/voicemail.db";
+  // The file, the folder with the same file, a new table in the same file, no file.
+  std::filesystem::rename(file, home / "kept");
+  std::filesystem::rename(otherFile, file);
+  EXPECT_EQ(store.copyToken(), theirs);
+  std::filesystem::rename(home / "Library/Voicemail", home / "moved");
+  home.directory("Library/Voicemail");
+  std::filesystem::rename(home / "moved/voicemail.db", file);
+  const std::string second = "second";
+  store.setToken(&second);
+  EXPECT_EQ(store.copyToken(), second);
+  plant("DROP TABLE general");
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  store.setToken(&token);
+  EXPECT_EQ(store.copyToken(), token);
+  std::filesystem::remove(file);
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  EXPECT_FALSE(isThere(file));
 }
 
 TEST_F(SqliteVoicemailStoreTest, WithoutAHomeTheStoreIsAlwaysEmpty) {
   RecordingLog log;
   for (const std::string& none : {std::string(), home / "missing"}) {
-    SqliteVoicemailStore without(none, 0, 0);
+    StoreAtHome without(none, 0, 0);
     without.setToken(&token);
     without.removeAllRecords();
     EXPECT_EQ(without.copyToken(), std::nullopt);
@@ -272,8 +318,8 @@ TEST_F(SqliteVoicemailStoreTest, AnAnsweredChangeIsHeldFastInItsFolder) {
   files->xSetSystemCall(files, "unlink", reinterpret_cast<sqlite3_syscall_ptr>(unlink));
   files->xSetSystemCall(files, "openDirectory", reinterpret_cast<sqlite3_syscall_ptr>(openDirectory));
   store.setTokenForKey("key", "value");
-  files->xSetSystemCall(files, "unlink", nullptr);
-  files->xSetSystemCall(files, "openDirectory", nullptr);
+  files->xSetSystemCall(files, "unlink", reinterpret_cast<sqlite3_syscall_ptr>(realUnlink));
+  files->xSetSystemCall(files, "openDirectory", reinterpret_cast<sqlite3_syscall_ptr>(realOpenDirectory));
   ASSERT_FALSE(calls.empty());
   EXPECT_EQ(std::count(calls.begin(), calls.end(), "unlink"), 1);
   EXPECT_EQ(calls.back(), "open folder to sync it");
@@ -302,7 +348,7 @@ TEST_F(SqliteVoicemailStoreTest, AnEndlessSearchIsCutOffAndTold) {
       "INSERT INTO general SELECT i, 'x' FROM n;");
   ManualSqliteTime time;
   time.perLook = 1ms;
-  SqliteVoicemailStore limited(home.path(), ::getuid(), ::getgid(), time.asTime());
+  StoreAtHome limited(home.path(), ::getuid(), ::getgid(), time.asTime());
   RecordingLog log;
   EXPECT_EQ(limited.copyToken(), std::nullopt);
   EXPECT_GT(time.now, SqliteVoicemailStore::kPatience);
@@ -353,7 +399,7 @@ TEST_F(SqliteVoicemailStoreTest, AStoreThatAnotherProcessHoldsDropsTheWriteAfter
   ASSERT_EQ(::sqlite3_open(file.c_str(), &handle), SQLITE_OK);
   ASSERT_EQ(::sqlite3_exec(handle, "BEGIN EXCLUSIVE", nullptr, nullptr, nullptr), SQLITE_OK);
   ManualSqliteTime time;
-  SqliteVoicemailStore limited(home.path(), ::getuid(), ::getgid(), time.asTime());
+  StoreAtHome limited(home.path(), ::getuid(), ::getgid(), time.asTime());
   RecordingLog log;
   const std::string other = "other";
   limited.setToken(&other);
@@ -377,7 +423,7 @@ TEST_F(SqliteVoicemailStoreTest, OnAFullDiskTheOldTokenIsStillRead) {
   home.directory("disk");
   inPrivateMounts([&] {
     mountSmallDisk(home / "disk", 64);
-    SqliteVoicemailStore small(home / "disk", ::getuid(), ::getgid());
+    StoreAtHome small(home / "disk", ::getuid(), ::getgid());
     small.setToken(&token);
     EXPECT_EQ(small.copyToken(), token);
     home.file("disk/filler", std::string(64 << 10, 'f'));
@@ -451,7 +497,7 @@ TEST_F(SqliteVoicemailStoreTest, KilledAmidSetsClearsAndResetsItHoldsWhatWasAnsw
   // In memory where the system has such a place: what a kill leaves is the same, and there is time for more.
   TemporaryDirectory memory(::access("/dev/shm", W_OK) == 0 ? std::filesystem::path("/dev/shm")
                                                             : std::filesystem::temp_directory_path());
-  SqliteVoicemailStore fast(memory.path(), ::getuid(), ::getgid());
+  StoreAtHome fast(memory.path(), ::getuid(), ::getgid());
   int done = 0;
   // More rounds, each longer than the one before, where the machine is so busy that few changes were made.
   for (int round = 0; round < 200 || (done <= 200 && round < 1200); ++round) {
@@ -512,7 +558,7 @@ TEST_F(SqliteVoicemailStoreTest, InAUserNamespaceWithoutTheAccountNothingIsWritt
   inPrivateMounts([&] {
     if (uid == 0 && ::unshare(CLONE_NEWUSER) != 0) return;
     RecordingLog log;
-    SqliteVoicemailStore of(home.path(), 501, 501);
+    StoreAtHome of(home.path(), 501, 501);
     of.setToken(&token);
     EXPECT_EQ(of.copyToken(), std::nullopt);
     EXPECT_EQ(log.entries(), (std::vector{RecordingLog::unifiedLine(

@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <functional>
@@ -75,6 +76,8 @@ class ScriptedWebClient final : public WebClient {
 
   // There is no memory for another session.
   bool exhausted = false;
+  // Requests that somebody has cancelled; they are answered all the same.
+  std::atomic<int> cancelled{0};
 
   std::shared_ptr<WebSession> makeSession() override {
     if (exhausted) throw std::bad_alloc();
@@ -106,6 +109,7 @@ class ScriptedWebClient final : public WebClient {
     void setCompletion(Completion completion) override { completion_ = std::move(completion); }
     void setTimeLimit(std::chrono::milliseconds limit) noexcept override { timeLimit_ = limit; }
     void setLargestBody(std::uint64_t bytes) noexcept override { largestBody_ = bytes; }
+    void cancel() noexcept override { ++client_.cancelled; }
     void send(std::vector<std::byte> body) override {
       if (std::exchange(sent_, true)) return;
       std::shared_ptr<WebResponse> response;

@@ -260,6 +260,17 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
     transfer->finish(kind);
   }
 
+  // Any thread.
+  void cancel(const std::shared_ptr<Transfer>& transfer) noexcept {
+    const std::lock_guard lock(mutex_);
+    if (closed_) return;
+    try {
+      queue_->post([self = shared_from_this(), transfer] { self->abandon(transfer); });
+    } catch (const std::bad_alloc&) {
+      // It goes on to its own limit.
+    }
+  }
+
   // Completes what is under way as cancelled and ends the queue. Not on the queue.
   void shutDown() noexcept {
     std::shared_ptr<WorkQueue> queue;
@@ -324,7 +335,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
     const auto left = std::chrono::ceil<milliseconds>(transfer->deadline - Clock::now());
     if (left <= milliseconds::zero()) return transfer->finish(WebErrorKind::timedOut);
 
-    transfer->response->body.clear();
+    transfer->response->body = settings_.bodiesForAnotherProcess ? WebBody::forAnotherProcess() : WebBody();
     transfer->head = ResponseHead();
     transfer->wayWasCellular = false;
     transfer->ownVerdict.reset();
@@ -578,6 +589,18 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
     }
   }
 
+  void abandon(const std::shared_ptr<Transfer>& transfer) noexcept {
+    if (transfer->easy == nullptr || active_.erase(transfer->easy.get()) == 0) return;
+    (void)curl_multi_remove_handle(multi_.get(), transfer->easy.get());
+    transfer->easy.reset();
+    transfer->finish(WebErrorKind::cancelled);
+    if (active_.empty()) {
+      due_.reset();
+      timer_.reset();
+    }
+    giveUpIfAsked();
+  }
+
   void abandonAll(WebErrorKind kind) noexcept {
     givingUp_ = true;  // what the loop still refuses below does not matter any more
     const auto abandoned = std::exchange(active_, {});
@@ -628,12 +651,18 @@ class CurlWebClient::Request final : public WebRequest {
     if (transfer_ != nullptr) transfer_->largestBody = std::min(bytes, kLargestWebBody);
   }
   void send(std::vector<std::byte>) override {
-    if (transfer_ != nullptr) driver_->submit(std::exchange(transfer_, nullptr));
+    if (transfer_ == nullptr) return;
+    sent_ = transfer_;
+    driver_->submit(std::exchange(transfer_, nullptr));
+  }
+  void cancel() noexcept override {
+    if (const auto transfer = sent_.lock()) driver_->cancel(transfer);
   }
 
  private:
   const std::shared_ptr<Driver> driver_;
   std::shared_ptr<Transfer> transfer_;  // until it is sent
+  std::weak_ptr<Transfer> sent_;
 };
 
 CurlWebClient::CurlWebClient(std::shared_ptr<Driver> driver) : driver_(std::move(driver)) {}

@@ -22,6 +22,7 @@ struct CurlSettings {
   std::chrono::milliseconds wholeLimit = std::chrono::minutes(1);
   std::uint64_t slowestBytesPerSecond = std::uint64_t{64} << 10;
   CellularRuleFiles cellularFiles;
+  bool bodiesForAnotherProcess = false;  // see WebBody
 };
 
 // The HTTP client on libcurl's multi interface, driven by a queue of its own. What is under way when it is

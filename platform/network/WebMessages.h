@@ -1,0 +1,43 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <span>
+#include <string>
+#include <vector>
+
+#include "platform/web/WebClient.h"
+
+namespace brenvik {
+
+// One HTTP request, as it goes to the worker.
+struct WebQuestion {
+  WebRequestType type = WebRequestType::get;
+  std::string url;
+  HeaderMap headers;
+  bool cellularAllowed = true;
+  std::chrono::milliseconds timeLimit{0};
+  std::uint64_t largestBody = kLargestWebBody;
+};
+
+// What the worker says of it. The body travels beside it, in sealed memory of exactly `bodySize` bytes.
+struct WebAnswer {
+  WebErrorKind errorKind = WebErrorKind::unknown;
+  int statusCode = 0;
+  HeaderMap headers;
+  std::uint64_t bodySize = 0;
+};
+
+// Nothing when it is not such a question or answer, or one that no correct program sends: of a body larger
+// than `largestBody`, or beside a failure; of texts with NUL bytes or line breaks in them. All throw
+// std::bad_alloc.
+std::vector<std::byte> encode(const WebQuestion& question);
+std::optional<WebQuestion> decodeWebQuestion(std::span<const std::byte> payload);
+std::vector<std::byte> encode(const WebAnswer& answer);
+std::optional<WebAnswer> decodeWebAnswer(std::span<const std::byte> payload, std::uint64_t largestBody);
+
+}  // namespace brenvik

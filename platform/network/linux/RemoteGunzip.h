@@ -1,0 +1,33 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <chrono>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/gzip/Gunzip.h"
+#include "platform/network/NetworkWork.h"
+#include "platform/worker/Worker.h"
+
+namespace brenvik {
+
+// Gunzip, in the network worker, which is handed the file. The caller's thread waits, as long as the worker
+// says now and then that it is at work.
+class RemoteGunzip final : public Gunzip {
+ public:
+  // The worker outlives it.
+  explicit RemoteGunzip(Worker& worker, std::chrono::milliseconds longestSilence = kLongestSilence) noexcept;
+
+  GunzipOutcome gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
+                           std::uint64_t largestOutput) noexcept override;
+
+  // Ends what is under way, and from now on everything at once, as unavailable. Any thread.
+  void shutDown() noexcept;
+
+ private:
+  Worker& worker_;
+  const std::chrono::milliseconds longestSilence_;
+  const UniqueFd stop_;  // readable once shut down
+};
+
+}  // namespace brenvik

@@ -1,0 +1,139 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/stores/RemoteVoicemailStore.h"
+
+#include <fcntl.h>
+
+#include <new>
+#include <utility>
+
+#include "platform/log/Log.h"
+
+namespace brenvik {
+
+using stores::Operation;
+using stores::VoicemailAnswer;
+using stores::VoicemailOutcome;
+using stores::VoicemailRequest;
+using Clock = std::chrono::steady_clock;
+
+// Sends the request, with the folder when the worker does not have it yet. A worker that has gone since the
+// last request is replaced once: it has seen nothing of this one.
+WorkerResult RemoteVoicemailStore::send(const VoicemailRequest& request, const StoreFolder::Opened& folder) {
+  WorkerMessage message = stores::encode(request);
+  for (int attempt = 0;; ++attempt) {
+    const bool isNew = !channel_.isOpen() || !told_.descriptor.isValid() || !told_.isSameAs(folder);
+    if (isNew) {
+      (void)folder_.prepare(folder);
+      message.descriptors.clear();
+      UniqueFd copy(::fcntl(folder.descriptor.get(), F_DUPFD_CLOEXEC, 0));
+      if (!copy.isValid()) return WorkerResult::outOfMemory;
+      message.descriptors.push_back(std::move(copy));
+    }
+    if (!channel_.isOpen()) {
+      const WorkerResult opened =
+          worker_.open(static_cast<std::uint32_t>(stores::Work::voicemail), &channel_);
+      if (opened != WorkerResult::done) return opened;
+    }
+    const WorkerResult sent = channel_.send(message);
+    if (sent == WorkerResult::done) {
+      if (isNew) {
+        // Held, so that no other folder can have its numbers.
+        told_ = {std::move(message.descriptors.back()), folder.device, folder.inode};
+      }
+      return sent;
+    }
+    worker_.giveUp(&channel_);
+    if (sent != WorkerResult::closed || attempt > 0) return sent;
+  }
+}
+
+RemoteVoicemailStore::Result RemoteVoicemailStore::exchange(VoicemailRequest* request,
+                                                            VoicemailAnswer* answer) {
+  const auto deadline = Clock::now() + patience_;
+  const auto ifMissing =
+      stores::writes(request->operation) ? StoreFolder::IfMissing::create : StoreFolder::IfMissing::fail;
+  StoreFolder::Opened folder;
+  switch (folder_.open(ifMissing, &folder)) {
+    case StoreFolder::State::open:
+      break;
+    case StoreFolder::State::missing:
+      return ifMissing == StoreFolder::IfMissing::fail ? Result::done : Result::failed;
+    case StoreFolder::State::unusable:
+      return Result::failed;
+    case StoreFolder::State::outOfMemory:
+      return Result::outOfMemory;
+  }
+  for (;;) {
+    request->serial = ++serial_;
+    const WorkerResult sent = send(*request, folder);
+    if (sent != WorkerResult::done)
+      return sent == WorkerResult::outOfMemory ? Result::outOfMemory : Result::failed;
+    WorkerMessage message;
+    const WorkerResult received = channel_.receive(&message, deadline);
+    auto decoded = received == WorkerResult::done ? stores::decodeVoicemailAnswer(message) : std::nullopt;
+    if (!decoded || decoded->serial != request->serial) {
+      // Of an answer that comes later nobody would know what it answers.
+      worker_.giveUp(&channel_);
+      return received == WorkerResult::outOfMemory ? Result::outOfMemory : Result::failed;
+    }
+    if (decoded->outcome == VoicemailOutcome::notAllowed) {
+      if (request->insists) return Result::failed;
+      (void)folder_.prepare(folder);  // somebody of root's has put a file there since
+      request->insists = true;
+      continue;
+    }
+    *answer = std::move(*decoded);
+    return answer->outcome == VoicemailOutcome::outOfMemory ? Result::outOfMemory : Result::done;
+  }
+}
+
+bool RemoteVoicemailStore::perform(Operation operation, const std::string* key, const std::string* token,
+                                   std::optional<std::string>* found) noexcept {
+  if (found != nullptr) found->reset();
+  Result result = Result::outOfMemory;
+  bool isToldByWorker = false;
+  try {
+    VoicemailRequest request;
+    request.operation = operation;
+    if (key != nullptr) request.key = *key;
+    if (token != nullptr) request.token = *token;
+    VoicemailAnswer answer;
+    result = exchange(&request, &answer);
+    isToldByWorker = result == Result::outOfMemory && answer.outcome == VoicemailOutcome::outOfMemory;
+    if (found != nullptr) *found = std::move(answer.token);
+  } catch (const std::bad_alloc&) {
+    // What the worker says now would be taken for the next answer.
+    worker_.giveUp(&channel_);
+  }
+  if (result != Result::done && !isToldByWorker) {
+    if (stores::writes(operation))
+      logUnified(LogLevel::error, "The voicemail store could not be written");
+    else
+      logUnified(LogLevel::error, "The voicemail store could not be read");
+  }
+  return result != Result::outOfMemory;
+}
+
+bool RemoteVoicemailStore::setToken(const std::string* token) noexcept {
+  return perform(token == nullptr ? Operation::clearToken : Operation::setToken, nullptr, token, nullptr);
+}
+
+bool RemoteVoicemailStore::setTokenForKey(const std::string& key, const std::string& token) noexcept {
+  return perform(Operation::setTokenForKey, &key, &token, nullptr);
+}
+
+bool RemoteVoicemailStore::removeAllRecords() noexcept {
+  return perform(Operation::removeAllRecords, nullptr, nullptr, nullptr);
+}
+
+bool RemoteVoicemailStore::readToken(std::optional<std::string>* token) noexcept {
+  return perform(Operation::readToken, nullptr, nullptr, token);
+}
+
+bool RemoteVoicemailStore::readTokenForKey(const std::string& key,
+                                           std::optional<std::string>* token) noexcept {
+  return perform(Operation::readTokenForKey, &key, nullptr, token);
+}
+
+}  // namespace brenvik

@@ -1,0 +1,52 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <utility>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/worker/WorkerMessage.h"
+
+namespace brenvik {
+
+// One end of a pair of connected AF_UNIX SOCK_SEQPACKET sockets. Closing it hangs up, also for whatever the
+// other end has not read yet. Each object belongs to one thread at a time.
+class WorkerChannel {
+ public:
+  // No channel: sending and receiving say `closed`.
+  WorkerChannel() = default;
+  explicit WorkerChannel(UniqueFd socket) noexcept : socket_(std::move(socket)) {}
+
+  // Two ends that are connected to each other, closed on exec(2). `outOfMemory` when there are no
+  // descriptors.
+  static WorkerResult makePair(WorkerChannel* one, WorkerChannel* other) noexcept;
+
+  // Never blocks: `full` when the other end has let too much pile up. The descriptors stay the caller's.
+  WorkerResult send(const WorkerMessage& message) noexcept;
+
+  // The next message, waited for until the deadline. A deadline that has passed: what is there already.
+  // `time_point::max()`: for ever. A message that is `malformed` is dropped, with its descriptors.
+  WorkerResult receive(WorkerMessage* message, std::chrono::steady_clock::time_point deadline) noexcept;
+
+  // For an event loop: readable when receive() would not wait.
+  int descriptor() const noexcept { return socket_.get(); }
+  bool isOpen() const noexcept { return socket_.isValid(); }
+  void close() noexcept { socket_.reset(); }
+  // Gives the socket away.
+  UniqueFd release() noexcept { return std::move(socket_); }
+
+  // Which worker it leads to, of all that there have been. For implementations of Worker.
+  std::uint64_t generation() const noexcept { return generation_; }
+  void setGeneration(std::uint64_t generation) noexcept { generation_ = generation; }
+
+ private:
+  UniqueFd socket_;
+  std::uint64_t generation_ = 0;
+};
+
+// Whether a descriptor is a connected socket of a channel's kind.
+bool isChannelSocket(int fd) noexcept;
+
+}  // namespace brenvik

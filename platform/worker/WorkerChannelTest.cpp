@@ -1,0 +1,182 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/worker/WorkerChannel.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "platform/worker/fakes/ThreadedWorker.h"
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+using Clock = std::chrono::steady_clock;
+
+class WorkerChannelTest : public testing::Test {
+ protected:
+  WorkerChannelTest() { EXPECT_EQ(WorkerChannel::makePair(&one, &other), WorkerResult::done); }
+
+  static std::vector<std::byte> bytesOf(const std::string& text) {
+    const auto bytes = std::as_bytes(std::span(text));
+    return {bytes.begin(), bytes.end()};
+  }
+  WorkerResult receiveNow(WorkerChannel& from) { return from.receive(&message, Clock::now()); }
+  static bool isOpen(int fd) { return ::fcntl(fd, F_GETFD) >= 0; }
+
+  // As another program could, past the rules of send().
+  void sendRaw(std::size_t size, std::size_t descriptors) {
+    std::vector<char> bytes(size);
+    iovec io{bytes.data(), bytes.size()};
+    std::vector<char> control(CMSG_SPACE(descriptors * sizeof(int)));
+    msghdr out{};
+    out.msg_iov = &io;
+    out.msg_iovlen = 1;
+    if (descriptors > 0) {
+      out.msg_control = control.data();
+      out.msg_controllen = control.size();
+      cmsghdr* const item = CMSG_FIRSTHDR(&out);
+      item->cmsg_level = SOL_SOCKET;
+      item->cmsg_type = SCM_RIGHTS;
+      item->cmsg_len = CMSG_LEN(descriptors * sizeof(int));
+      const int fd = STDERR_FILENO;
+      for (std::size_t i = 0; i < descriptors; ++i)
+        std::memcpy(CMSG_DATA(item) + i * sizeof fd, &fd, sizeof fd);
+    }
+    ASSERT_EQ(::sendmsg(one.descriptor(), &out, 0), static_cast<ssize_t>(size));
+  }
+  static int freeDescriptor() {
+    const UniqueFd next(::dup(STDERR_FILENO));
+    return next.get();
+  }
+
+  WorkerChannel one;
+  WorkerChannel other;
+  WorkerMessage message;
+};
+
+TEST_F(WorkerChannelTest, AMessageArrivesAsItWasSent) {
+  WorkerMessage sent;
+  sent.kind = 0xFEDCBA98;
+  sent.payload = bytesOf("payload");
+  sent.descriptors.emplace_back(::open("/dev/null", O_RDWR | O_CLOEXEC));
+  ASSERT_EQ(one.send(sent), WorkerResult::done);
+  ASSERT_EQ(receiveNow(other), WorkerResult::done);
+  EXPECT_EQ(message.kind, 0xFEDCBA98U);
+  EXPECT_EQ(message.payload, bytesOf("payload"));
+  ASSERT_EQ(message.descriptors.size(), 1U);
+  EXPECT_NE(::fcntl(message.descriptors[0].get(), F_GETFD) & FD_CLOEXEC, 0);
+}
+
+TEST_F(WorkerChannelTest, TheLongestMessageArrivesAndALongerOneIsNotSent) {
+  WorkerMessage sent;
+  sent.payload.resize(WorkerMessage::kLongestPayload);
+  for (std::size_t i = 0; i < WorkerMessage::kMostDescriptors; ++i)
+    sent.descriptors.emplace_back(::dup(STDERR_FILENO));
+  ASSERT_EQ(one.send(sent), WorkerResult::done);
+  ASSERT_EQ(receiveNow(other), WorkerResult::done);
+  EXPECT_EQ(message.payload.size(), WorkerMessage::kLongestPayload);
+  EXPECT_EQ(message.descriptors.size(), WorkerMessage::kMostDescriptors);
+  sent.payload.resize(WorkerMessage::kLongestPayload + 1);
+  EXPECT_EQ(one.send(sent), WorkerResult::malformed);
+  sent.payload.clear();
+  sent.descriptors.emplace_back(::dup(STDERR_FILENO));
+  EXPECT_EQ(one.send(sent), WorkerResult::malformed);
+}
+
+TEST_F(WorkerChannelTest, NothingThereIsATimeOut) {
+  EXPECT_EQ(receiveNow(other), WorkerResult::timedOut);
+  const auto before = Clock::now();
+  EXPECT_EQ(other.receive(&message, before + 5ms), WorkerResult::timedOut);
+  EXPECT_GE(Clock::now(), before + 5ms);
+}
+
+TEST_F(WorkerChannelTest, WhoHangsUpIsNoticedAfterWhatWasSent) {
+  ASSERT_EQ(one.send({.kind = 3, .payload = {}, .descriptors = {}}), WorkerResult::done);
+  one.close();
+  EXPECT_EQ(receiveNow(other), WorkerResult::done);
+  EXPECT_EQ(receiveNow(other), WorkerResult::closed);
+  EXPECT_EQ(other.receive(&message, Clock::time_point::max()), WorkerResult::closed);
+  EXPECT_EQ(other.send({}), WorkerResult::closed);
+  WorkerChannel none;
+  EXPECT_EQ(none.send({}), WorkerResult::closed);
+  EXPECT_EQ(receiveNow(none), WorkerResult::closed);
+}
+
+TEST_F(WorkerChannelTest, WhoDoesNotReadIsFullAndBlocksNobody) {
+  WorkerMessage sent;
+  sent.payload.resize(10'000);
+  int messages = 0;
+  while (one.send(sent) == WorkerResult::done) ASSERT_LT(++messages, 10'000);
+  EXPECT_EQ(one.send(sent), WorkerResult::full);
+  EXPECT_EQ(receiveNow(other), WorkerResult::done);
+}
+
+TEST_F(WorkerChannelTest, WhatIsNoMessageIsDroppedWithItsDescriptors) {
+  const int before = freeDescriptor();
+  const auto expectRefused = [&](std::size_t size, std::size_t descriptors) {
+    sendRaw(size, descriptors);
+    EXPECT_EQ(receiveNow(other), WorkerResult::malformed) << size << ", " << descriptors;
+    EXPECT_TRUE(message.payload.empty());
+    EXPECT_TRUE(message.descriptors.empty());
+    EXPECT_EQ(freeDescriptor(), before);
+  };
+  expectRefused(3, 0);
+  expectRefused(3, 1);
+  expectRefused(8, 5);
+  expectRefused(8, 253);
+  expectRefused(WorkerMessage::kLongestPayload + 5, 1);
+  sendRaw(4, 4);
+  EXPECT_EQ(receiveNow(other), WorkerResult::done);
+  EXPECT_EQ(message.descriptors.size(), 4U);
+}
+
+TEST_F(WorkerChannelTest, WithoutDescriptorsTheyAreALackOfThisProcess) {
+  sendRaw(8, 3);
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+  const rlimit none{0, before.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &none), 0);
+  const WorkerResult result = receiveNow(other);
+  WorkerChannel a;
+  WorkerChannel b;
+  const WorkerResult pair = WorkerChannel::makePair(&a, &b);
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
+  EXPECT_EQ(result, WorkerResult::outOfMemory);
+  EXPECT_EQ(pair, WorkerResult::outOfMemory);
+}
+
+TEST(ThreadedWorkerTest, ChannelsAreServedAndHangUpWithTheWorker) {
+  ThreadedWorker worker([](std::uint32_t work, WorkerChannel channel) {
+    WorkerMessage message;
+    while (channel.receive(&message, Clock::time_point::max()) == WorkerResult::done) {
+      message.kind += work;
+      (void)channel.send(message);
+    }
+  });
+  WorkerChannel first;
+  WorkerChannel second;
+  ASSERT_EQ(worker.open(100, &first), WorkerResult::done);
+  ASSERT_EQ(worker.open(200, &second), WorkerResult::done);
+  WorkerMessage message;
+  for (int i = 0; i < 3; ++i) {
+    ASSERT_EQ(first.send({.kind = 1, .payload = {}, .descriptors = {}}), WorkerResult::done);
+    ASSERT_EQ(first.receive(&message, Clock::now() + 10s), WorkerResult::done);
+    EXPECT_EQ(message.kind, 101U);
+  }
+  worker.giveUp(&first);
+  EXPECT_EQ(second.receive(&message, Clock::now() + 10s), WorkerResult::closed);
+  worker.giveUp(&second);
+  EXPECT_EQ(worker.givenUp(), 1) << "the other one was of a worker that is gone";
+}
+
+}  // namespace
+}  // namespace brenvik

@@ -1,0 +1,235 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/worker/linux/WorkerProgram.h"
+
+#include <fcntl.h>
+#include <limits.h>
+#include <poll.h>
+#include <spawn.h>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <csignal>
+#include <cstring>
+#include <new>
+#include <utility>
+
+#include "platform/base/ErrorText.h"
+#include "platform/log/Log.h"
+
+namespace brenvik {
+namespace {
+
+using std::chrono::milliseconds;
+
+// A process that waits in the kernel for somebody's file system outlives its SIGKILL. With so many of them,
+// no further worker is started.
+constexpr std::size_t kMostDying = 8;
+// How long a worker that was killed, or has closed its end, is waited for, on the caller's thread: a hundred
+// times what it takes.
+constexpr milliseconds kToBeReaped{20};
+// A worker leaves as soon as its connection hangs up, in about a millisecond.
+constexpr milliseconds kToLeave{250};
+
+bool hasHungUp(const WorkerChannel& channel, milliseconds patience) noexcept {
+  pollfd waited{channel.descriptor(), 0, 0};
+  return ::poll(&waited, 1, static_cast<int>(patience.count())) > 0 && (waited.revents & POLLHUP) != 0;
+}
+
+}  // namespace
+
+std::vector<std::string> workerProgramFolders() {
+  std::vector<std::string> folders;
+  std::array<char, PATH_MAX> program{};
+  const auto size = ::readlink("/proc/self/exe", program.data(), program.size() - 1);
+  if (size > 0) {
+    const std::string path(program.data(), static_cast<std::size_t>(size));
+    folders.push_back(path.substr(0, path.rfind('/')));
+  }
+  folders.emplace_back(BRENVIK_WORKER_DIRECTORY);
+  return folders;
+}
+
+WorkerProgram::WorkerProgram(Description description, std::function<Clock::time_point()> now)
+    : description_(std::move(description)), now_(std::move(now)) {
+  dying_.reserve(kMostDying);
+}
+
+WorkerProgram::~WorkerProgram() { endWorker(kToLeave); }
+
+bool WorkerProgram::mayLog() noexcept {
+  const auto now = now_();
+  if (linesPaidUntil_ > now + (kLinesInARow - 1) * kOneMoreLineEvery) return false;
+  linesPaidUntil_ = std::max(linesPaidUntil_, now) + kOneMoreLineEvery;
+  return true;
+}
+
+WorkerResult WorkerProgram::open(std::uint32_t work, WorkerChannel* channel) noexcept {
+  channel->close();
+  WorkerChannel ours;
+  WorkerChannel theirs;
+  if (const WorkerResult made = WorkerChannel::makePair(&ours, &theirs); made != WorkerResult::done)
+    return made;
+  try {
+    WorkerMessage message;
+    message.kind = work;
+    message.descriptors.push_back(theirs.release());
+    const std::lock_guard lock(mutex_);
+    for (int attempt = 0; attempt < 2; ++attempt) {
+      if (!connection_.isOpen()) {
+        if (const WorkerResult reached = reach(); reached != WorkerResult::done) return reached;
+      }
+      const WorkerResult sent = connection_.send(message);
+      if (sent == WorkerResult::done) {
+        ours.setGeneration(generation_);
+        *channel = std::move(ours);
+        return WorkerResult::done;
+      }
+      if (sent != WorkerResult::closed) return sent;
+      if (mayLog()) logUnified(LogLevel::error, "%s has died", description_.program.c_str());
+      endWorker(kToBeReaped);
+    }
+    return WorkerResult::unavailable;
+  } catch (const std::bad_alloc&) {
+    return WorkerResult::outOfMemory;
+  }
+}
+
+void WorkerProgram::giveUp(WorkerChannel* channel) noexcept {
+  WorkerChannel given = std::move(*channel);
+  const std::lock_guard lock(mutex_);
+  if (!given.isOpen() || given.generation() != generation_ || !connection_.isOpen()) return;
+  // A process that ends closes one descriptor after the other. One that lives keeps its main connection.
+  const milliseconds patience = hasHungUp(given, milliseconds(0)) ? kToBeReaped : milliseconds(0);
+  const bool hasDied = hasHungUp(connection_, patience);
+  if (mayLog()) {
+    if (hasDied)
+      logUnified(LogLevel::error, "%s has died", description_.program.c_str());
+    else
+      logUnified(LogLevel::error, "%s does not answer as it should, and is ended",
+                 description_.program.c_str());
+  }
+  endWorker(milliseconds(0));
+}
+
+// Hangs up; a child that is still there after that time is killed.
+void WorkerProgram::endWorker(milliseconds mayTake) noexcept {
+  connection_.close();
+  Child child = std::exchange(child_, {});
+  if (child.pid <= 0 || isReaped(child, mayTake)) return;
+  (void)::kill(child.pid, SIGKILL);  // its number is its own until it is reaped
+  if (isReaped(child, kToBeReaped)) return;
+  dying_.push_back(std::move(child));
+}
+
+bool WorkerProgram::isReaped(const Child& child, milliseconds patience) noexcept {
+  pollfd gone{child.process.get(), POLLIN, 0};
+  if (child.process.isValid() && patience.count() > 0)
+    (void)::poll(&gone, 1, static_cast<int>(patience.count()));
+  const pid_t reaped = ::waitpid(child.pid, nullptr, WNOHANG);
+  return reaped == child.pid || (reaped < 0 && errno == ECHILD);
+}
+
+WorkerResult WorkerProgram::reach() {
+  std::erase_if(dying_, [](const Child& child) { return isReaped(child, milliseconds(0)); });
+  WorkerResult reached = connectToService();
+  if (reached == WorkerResult::closed) reached = startChild();
+  if (reached == WorkerResult::done) ++generation_;
+  return reached;
+}
+
+// `closed` when nobody listens.
+WorkerResult WorkerProgram::connectToService() {
+  const std::string path = description_.bootstrap + "/" + description_.service;
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  if (path.size() >= sizeof address.sun_path) return WorkerResult::closed;
+  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+  UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  if (!socket.isValid()) return WorkerResult::outOfMemory;
+  int error = 0;
+  if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
+    error = errno;
+    if (error == ENOENT || error == ECONNREFUSED) return WorkerResult::closed;
+  } else {
+    ucred peer{};
+    socklen_t size = sizeof peer;
+    if (::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) error = errno;
+    // Whoever listens was root's service manager; its folder is root's anyway.
+    if (error == 0 && peer.uid != 0 && peer.uid != ::geteuid()) error = EACCES;
+  }
+  if (error != 0) {
+    if (mayLog()) logUnified(LogLevel::error, "cannot connect to %s: %s", path.c_str(), describeError(error));
+    return WorkerResult::unavailable;
+  }
+  connection_ = WorkerChannel(std::move(socket));
+  return WorkerResult::done;
+}
+
+WorkerResult WorkerProgram::startChild() {
+  WorkerChannel ours;
+  WorkerChannel theirs;
+  if (const WorkerResult made = WorkerChannel::makePair(&ours, &theirs); made != WorkerResult::done)
+    return made;
+  int error = EAGAIN;
+  if (dying_.size() < kMostDying) {
+    for (const std::string& folder :
+         description_.folders.empty() ? workerProgramFolders() : description_.folders) {
+      error = start(folder + "/" + description_.program, theirs.descriptor());
+      if (error == 0) {
+        connection_ = std::move(ours);
+        return WorkerResult::done;
+      }
+      if (error != ENOENT && error != ENOTDIR) break;
+    }
+  }
+  if (mayLog())
+    logUnified(LogLevel::error, "cannot start %s: %s", description_.program.c_str(), describeError(error));
+  return error == ENOMEM || error == EMFILE || error == ENFILE ? WorkerResult::outOfMemory
+                                                               : WorkerResult::unavailable;
+}
+
+// With its end of the connection as standard input, and no other descriptor of this process than standard
+// error.
+int WorkerProgram::start(const std::string& path, int theirs) {
+  posix_spawn_file_actions_t actions;
+  posix_spawnattr_t attributes;
+  if (const int error = ::posix_spawn_file_actions_init(&actions); error != 0) return error;
+  if (const int error = ::posix_spawnattr_init(&attributes); error != 0) {
+    ::posix_spawn_file_actions_destroy(&actions);
+    return error;
+  }
+  sigset_t all;
+  sigset_t none;
+  ::sigfillset(&all);
+  ::sigemptyset(&none);
+  std::string name = description_.program;
+  char* const arguments[] = {name.data(), nullptr};
+  char* const environment[] = {nullptr};
+  int error = ::posix_spawn_file_actions_adddup2(&actions, theirs, STDIN_FILENO);
+  if (error == 0)
+    error = ::posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
+  if (error == 0) error = ::posix_spawn_file_actions_addclosefrom_np(&actions, STDERR_FILENO + 1);
+  if (error == 0) error = ::posix_spawnattr_setsigdefault(&attributes, &all);
+  if (error == 0) error = ::posix_spawnattr_setsigmask(&attributes, &none);
+  if (error == 0) {
+    error = ::posix_spawnattr_setflags(&attributes,
+                                       static_cast<short>(POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETSIGMASK));
+  }
+  pid_t pid = -1;
+  if (error == 0) error = ::posix_spawn(&pid, path.c_str(), &actions, &attributes, arguments, environment);
+  ::posix_spawnattr_destroy(&attributes);
+  ::posix_spawn_file_actions_destroy(&actions);
+  if (error != 0) return error;
+  child_.pid = pid;
+  child_.process.reset(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
+  return 0;
+}
+
+}  // namespace brenvik

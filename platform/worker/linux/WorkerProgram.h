@@ -1,0 +1,73 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/base/UniqueFd.h"
+#include "platform/worker/Worker.h"
+
+namespace brenvik {
+
+// One worker, behind the socket of its named service. Where nobody listens there, it is this process's child:
+// the program beside this one, or where it is installed. Both come with the first open(), and again after the
+// worker's death. What goes wrong is logged, a few lines in a row at most. Any thread.
+class WorkerProgram final : public Worker {
+ public:
+  struct Description {
+    std::string service;    // name of the service
+    std::string program;    // name of the program
+    std::string bootstrap;  // folder of the services' sockets
+    // Folders where the program may lie, best first; without any, those of workerProgramFolders().
+    std::vector<std::string> folders;
+  };
+  using Clock = std::chrono::steady_clock;
+
+  // Lines that may come in a row, and how long it takes until one more may.
+  static constexpr int kLinesInARow = 5;
+  static constexpr std::chrono::seconds kOneMoreLineEvery{10};
+
+  explicit WorkerProgram(Description description, std::function<Clock::time_point()> now = &Clock::now);
+  WorkerProgram(const WorkerProgram&) = delete;
+  WorkerProgram& operator=(const WorkerProgram&) = delete;
+  // Hangs up, and ends a child that does not leave.
+  ~WorkerProgram() override;
+
+  WorkerResult open(std::uint32_t work, WorkerChannel* channel) noexcept override;
+  void giveUp(WorkerChannel* channel) noexcept override;
+
+ private:
+  struct Child {
+    pid_t pid = -1;
+    UniqueFd process;  // pidfd_open(2); invalid when there was no descriptor for it
+  };
+
+  WorkerResult reach();
+  WorkerResult connectToService();
+  WorkerResult startChild();
+  int start(const std::string& path, int theirs);
+  void endWorker(std::chrono::milliseconds mayTake) noexcept;
+  static bool isReaped(const Child& child, std::chrono::milliseconds patience) noexcept;
+  bool mayLog() noexcept;
+
+  const Description description_;
+  const std::function<Clock::time_point()> now_;
+  std::mutex mutex_;  // guards everything below
+  WorkerChannel connection_;
+  std::uint64_t generation_ = 0;
+  Child child_;
+  std::vector<Child> dying_;  // killed, and not gone yet
+  Clock::time_point linesPaidUntil_{};
+};
+
+// The folder of the running program, then the one where workers are installed.
+std::vector<std::string> workerProgramFolders();
+
+}  // namespace brenvik

@@ -1,0 +1,343 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/worker/linux/WorkerProgram.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/base/ProcessFacts.h"
+#include "platform/files/fakes/TemporaryDirectory.h"
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/worker/WorkerFields.h"
+#include "platform/worker/linux/SealedMemory.h"
+#include "platform/worker/linux/WorkerHost.h"
+#include "testing/Works.h"
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+using Clock = std::chrono::steady_clock;
+
+constexpr const char* kService = "org.test.worker";
+
+std::vector<pid_t> children() {
+  std::vector<pid_t> found;
+  std::ifstream list("/proc/thread-self/children");
+  for (pid_t pid = 0; list >> pid;) found.push_back(pid);
+  return found;
+}
+
+class WorkerProgramTest : public testing::Test {
+ protected:
+  WorkerProgram::Description description(std::vector<std::string> folders = {}) {
+    return {.service = kService,
+            .program = "worker_for_tests",
+            .bootstrap = folder.path(),
+            .folders = std::move(folders)};
+  }
+  static WorkerResult open(WorkerProgram& worker, WorkForTests work, WorkerChannel* channel) {
+    return worker.open(static_cast<std::uint32_t>(work), channel);
+  }
+  WorkerResult receive(WorkerChannel& channel) { return channel.receive(&message, Clock::now() + 20s); }
+  // What an echo says: the channel works.
+  bool echoes(WorkerChannel& channel, std::uint32_t kind = 42) {
+    return channel.send({.kind = kind, .payload = {}, .descriptors = {}}) == WorkerResult::done &&
+           receive(channel) == WorkerResult::done && message.kind == kind;
+  }
+  bool works(WorkerProgram& worker) {
+    WorkerChannel channel;
+    return open(worker, WorkForTests::echo, &channel) == WorkerResult::done && echoes(channel);
+  }
+  void die(WorkerProgram& worker) {
+    WorkerChannel channel;
+    ASSERT_EQ(open(worker, WorkForTests::die, &channel), WorkerResult::done);
+    ASSERT_EQ(channel.send({}), WorkerResult::done);
+    EXPECT_EQ(receive(channel), WorkerResult::closed);
+    worker.giveUp(&channel);
+  }
+  std::vector<std::string> lines() const {
+    std::vector<std::string> texts;
+    for (const auto& entry : log.entries()) texts.push_back(entry.line);
+    return texts;
+  }
+
+  TemporaryDirectory folder;
+  RecordingLog log;
+  WorkerMessage message;
+};
+
+TEST_F(WorkerProgramTest, WhereNobodyListensTheProgramBesideThisOneIsStartedOnce) {
+  WorkerProgram worker(description());
+  EXPECT_TRUE(children().empty()) << "not before it is needed";
+  WorkerChannel one;
+  WorkerChannel other;
+  ASSERT_EQ(open(worker, WorkForTests::echo, &one), WorkerResult::done);
+  ASSERT_EQ(open(worker, WorkForTests::echo, &other), WorkerResult::done);
+  EXPECT_TRUE(echoes(one, 1));
+  EXPECT_TRUE(echoes(other, 2));
+  EXPECT_TRUE(echoes(one, 3));
+  EXPECT_EQ(children().size(), 1U);
+  EXPECT_EQ(lines(), std::vector<std::string>());
+}
+
+TEST_F(WorkerProgramTest, TheWorkerLeavesWithItsOwner) {
+  pid_t child = -1;
+  {
+    WorkerProgram worker(description());
+    ASSERT_TRUE(works(worker));
+    ASSERT_EQ(children().size(), 1U);
+    child = children()[0];
+  }
+  EXPECT_FALSE(processFacts(child).has_value()) << "gone, and reaped";
+}
+
+TEST_F(WorkerProgramTest, AWorkerHasNothingButWhatItWasGiven) {
+  ::setenv("BRENVIK_LEAK", "1", 1);
+  const UniqueFd leak(::open("/dev/null", O_RDONLY));  // not closed on exec
+  WorkerProgram worker(description());
+  WorkerChannel channel;
+  ASSERT_EQ(open(worker, WorkForTests::report, &channel), WorkerResult::done);
+  ASSERT_EQ(receive(channel), WorkerResult::done);
+  FieldReader reader(message.payload);
+  const uid_t uid = reader.u32();
+  const gid_t gid = reader.u32();
+  const std::string groups(reader.text());
+  const std::string capabilities(reader.text());
+  const std::string noNewPrivileges(reader.text());
+  const std::uint32_t descriptors = reader.u32();
+  const std::uint32_t variables = reader.u32();
+  const std::uint64_t limit = reader.u64();
+  ASSERT_TRUE(reader.whole());
+  EXPECT_EQ(capabilities, "0000000000000000");
+  EXPECT_EQ(noNewPrivileges, "1");
+  EXPECT_EQ(variables, 0U);
+  EXPECT_EQ(limit, 256U);
+  // Three standard ones, the connection, this channel, and the journal's socket if it has one.
+  EXPECT_LE(descriptors, 6U);
+  if (::geteuid() == 0) {
+    EXPECT_EQ(uid, 65534U);
+    EXPECT_EQ(gid, 65534U);
+    EXPECT_EQ(groups, "");
+  } else {
+    EXPECT_EQ(uid, ::getuid());
+  }
+  ::unsetenv("BRENVIK_LEAK");
+}
+
+TEST_F(WorkerProgramTest, DeathHangsUpAllChannelsAndTheNextOneHasANewWorker) {
+  WorkerProgram worker(description());
+  WorkerChannel bystander;
+  ASSERT_EQ(open(worker, WorkForTests::echo, &bystander), WorkerResult::done);
+  ASSERT_TRUE(echoes(bystander));
+  die(worker);
+  EXPECT_TRUE(children().empty()) << "the dead one is reaped";
+  EXPECT_EQ(receive(bystander), WorkerResult::closed);
+  EXPECT_TRUE(works(worker));
+  EXPECT_EQ(log.entries(),
+            std::vector({RecordingLog::unifiedLine(LogLevel::error, "worker_for_tests has died")}));
+}
+
+TEST_F(WorkerProgramTest, TenDeathsInARowAreFollowedByAWorkerThatWorksAndAFewLines) {
+  Clock::time_point now = Clock::now();
+  WorkerProgram worker(description(), [&now] { return now; });
+  for (int i = 0; i < 10; ++i) die(worker);
+  EXPECT_TRUE(works(worker));
+  EXPECT_LE(children().size(), 1U);
+  EXPECT_EQ(log.entries().size(), static_cast<std::size_t>(WorkerProgram::kLinesInARow));
+  now += WorkerProgram::kOneMoreLineEvery;
+  die(worker);
+  EXPECT_TRUE(works(worker));
+  EXPECT_EQ(log.entries().size(), static_cast<std::size_t>(WorkerProgram::kLinesInARow + 1));
+}
+
+TEST_F(WorkerProgramTest, AWorkerThatHangsIsEndedAndTheNextOneIsNew) {
+  WorkerProgram worker(description());
+  WorkerChannel bystander;
+  ASSERT_EQ(open(worker, WorkForTests::echo, &bystander), WorkerResult::done);
+  WorkerChannel hung;
+  ASSERT_EQ(open(worker, WorkForTests::hang, &hung), WorkerResult::done);
+  ASSERT_TRUE(echoes(bystander));
+  EXPECT_EQ(hung.receive(&message, Clock::now()), WorkerResult::timedOut);
+  worker.giveUp(&hung);
+  EXPECT_FALSE(hung.isOpen());
+  EXPECT_EQ(receive(bystander), WorkerResult::closed);
+  EXPECT_TRUE(children().empty());
+  WorkerChannel next;
+  ASSERT_EQ(open(worker, WorkForTests::echo, &next), WorkerResult::done);
+  worker.giveUp(&bystander);  // of the one that is gone: the new one stays
+  EXPECT_TRUE(echoes(next));
+  EXPECT_EQ(lines(),
+            std::vector<std::string>({"worker_for_tests does not answer as it should, and is ended"}));
+}
+
+TEST_F(WorkerProgramTest, AWorkerThatDiedWhileNobodyLookedIsReplacedAtTheNextOpen) {
+  WorkerProgram worker(description());
+  ASSERT_TRUE(works(worker));
+  ASSERT_EQ(children().size(), 1U);
+  ASSERT_EQ(::kill(children()[0], SIGKILL), 0);
+  siginfo_t info{};
+  ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(children()[0]), &info, WEXITED | WNOWAIT), 0);
+  EXPECT_TRUE(works(worker));
+  EXPECT_EQ(children().size(), 1U);
+  EXPECT_EQ(lines(), std::vector<std::string>({"worker_for_tests has died"}));
+}
+
+TEST_F(WorkerProgramTest, AProgramThatIsNotThereIsUnavailableWithItsReason) {
+  WorkerProgram worker(description({folder / "nowhere", folder / "neither"}));
+  WorkerChannel channel;
+  for (int i = 0; i < 10; ++i)
+    EXPECT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::unavailable);
+  EXPECT_FALSE(channel.isOpen());
+  ASSERT_EQ(log.entries().size(), static_cast<std::size_t>(WorkerProgram::kLinesInARow));
+  EXPECT_EQ(lines()[0], "cannot start worker_for_tests: No such file or directory");
+}
+
+TEST_F(WorkerProgramTest, TheSecondFolderServesWhereTheFirstHasNone) {
+  WorkerProgram worker(description({folder / "nowhere", workerProgramFolders()[0]}));
+  EXPECT_TRUE(works(worker));
+}
+
+TEST_F(WorkerProgramTest, AProgramThatLeavesAtOnceHangsUp) {
+  const std::string script = folder / "worker_for_tests";
+  std::filesystem::create_symlink("/bin/true", script);
+  WorkerProgram worker(description({folder.path()}));
+  WorkerChannel channel;
+  ASSERT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::done);
+  EXPECT_EQ(receive(channel), WorkerResult::closed);
+}
+
+TEST_F(WorkerProgramTest, SealedMemoryArrivesAndMemoryThatCanChangeIsRefused) {
+  WorkerProgram worker(description());
+  WorkerChannel channel;
+  ASSERT_EQ(open(worker, WorkForTests::sealedMemory, &channel), WorkerResult::done);
+  ASSERT_EQ(receive(channel), WorkerResult::done);
+  ASSERT_EQ(message.descriptors.size(), 1U);
+  SealedMemory memory;
+  EXPECT_EQ(SealedMemory::map(message.descriptors[0].get(), 99'999, &memory), WorkerResult::malformed);
+  EXPECT_EQ(SealedMemory::map(message.descriptors[0].get(), 100'001, &memory), WorkerResult::malformed);
+  ASSERT_EQ(SealedMemory::map(message.descriptors[0].get(), 100'000, &memory), WorkerResult::done);
+  message.descriptors.clear();
+  ASSERT_EQ(memory.bytes().size(), 100'000U);
+  EXPECT_EQ(memory.bytes().back(), std::byte{'x'});
+  const SealedMemory moved = std::move(memory);
+  EXPECT_EQ(moved.bytes().front(), std::byte{'x'});
+
+  ASSERT_EQ(open(worker, WorkForTests::openMemory, &channel), WorkerResult::done);
+  ASSERT_EQ(receive(channel), WorkerResult::done);
+  ASSERT_EQ(message.descriptors.size(), 1U);
+  EXPECT_EQ(SealedMemory::map(message.descriptors[0].get(), 100'000, &memory), WorkerResult::malformed);
+  const UniqueFd file(::open("/etc/passwd", O_RDONLY | O_CLOEXEC));
+  EXPECT_EQ(SealedMemory::map(file.get(), 0, &memory), WorkerResult::malformed);
+}
+
+// ---- behind the socket of the named service
+
+class WorkerServiceTest : public WorkerProgramTest {
+ protected:
+  // As the service manager's socket unit does.
+  UniqueFd listen(int type = SOCK_SEQPACKET) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    const std::string path = folder / kService;
+    std::strcpy(address.sun_path, path.c_str());
+    UniqueFd socket(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
+    EXPECT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    EXPECT_EQ(::listen(socket.get(), 1), 0);
+    return socket;
+  }
+};
+
+TEST_F(WorkerServiceTest, WhereSomebodyListensNoProgramIsStarted) {
+  const UniqueFd socket = listen();
+  WorkerProgram worker(description({folder / "nowhere"}));
+  WorkerChannel channel;
+  ASSERT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::done);
+  EXPECT_EQ(channel.send({.kind = 42, .payload = {}, .descriptors = {}}), WorkerResult::done);
+
+  WorkerChannel connection(UniqueFd(::accept4(socket.get(), nullptr, nullptr, SOCK_CLOEXEC)));
+  ASSERT_TRUE(connection.isOpen());
+  std::uint32_t work = 0;
+  std::thread host([&] {
+    WorkerHost::serveConnection(std::move(connection), [&work](std::uint32_t kind, WorkerChannel theirs) {
+      work = kind;
+      WorkerMessage got;
+      (void)theirs.receive(&got, Clock::now() + 20s);
+      (void)theirs.send(got);
+    });
+  });
+  EXPECT_EQ(receive(channel), WorkerResult::done);
+  EXPECT_EQ(message.kind, 42U);
+  worker.giveUp(&channel);  // hangs up
+  host.join();
+  EXPECT_EQ(work, static_cast<std::uint32_t>(WorkForTests::echo));
+  EXPECT_TRUE(children().empty());
+}
+
+TEST_F(WorkerServiceTest, ASocketThatNobodyListensBehindIsAsGoodAsNone) {
+  listen().reset();
+  WorkerProgram worker(description());
+  EXPECT_TRUE(works(worker));
+}
+
+TEST_F(WorkerServiceTest, AQueueThatIsFullKeepsNobodyWaiting) {
+  const UniqueFd socket = listen();
+  WorkerProgram first(description());
+  WorkerProgram second(description());
+  WorkerProgram third(description());
+  WorkerChannel channel;
+  EXPECT_EQ(open(first, WorkForTests::echo, &channel), WorkerResult::done);
+  EXPECT_EQ(open(second, WorkForTests::echo, &channel), WorkerResult::done);
+  EXPECT_EQ(open(third, WorkForTests::echo, &channel), WorkerResult::unavailable);
+  ASSERT_EQ(log.entries().size(), 1U);
+  EXPECT_EQ(lines()[0], "cannot connect to " + (folder / kService) + ": Resource temporarily unavailable");
+}
+
+TEST_F(WorkerServiceTest, AnotherKindOfSocketIsNoWorker) {
+  const UniqueFd socket = listen(SOCK_STREAM);
+  WorkerProgram worker(description());
+  WorkerChannel channel;
+  EXPECT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::unavailable);
+  EXPECT_EQ(log.entries().size(), 1U);
+}
+
+TEST(WorkerHostTest, WhatIsNoOpeningOfAChannelIsPassedOver) {
+  WorkerChannel ours;
+  WorkerChannel theirs;
+  ASSERT_EQ(WorkerChannel::makePair(&ours, &theirs), WorkerResult::done);
+  WorkerMessage without;
+  WorkerMessage noSocket;
+  noSocket.descriptors.emplace_back(::open("/dev/null", O_RDWR | O_CLOEXEC));
+  WorkerMessage two;
+  WorkerMessage good;
+  good.kind = 5;
+  WorkerChannel ends[6];
+  for (int i = 0; i < 6; i += 2)
+    ASSERT_EQ(WorkerChannel::makePair(&ends[i], &ends[i + 1]), WorkerResult::done);
+  two.descriptors.push_back(ends[0].release());
+  two.descriptors.push_back(ends[2].release());
+  good.descriptors.push_back(ends[4].release());
+  for (const WorkerMessage* each : {&without, &noSocket, &two, &good}) {
+    ASSERT_EQ(ours.send(*each), WorkerResult::done);
+  }
+  ours.close();
+  std::vector<std::uint32_t> served;
+  WorkerHost::serveConnection(std::move(theirs),
+                              [&](std::uint32_t work, WorkerChannel) { served.push_back(work); });
+  EXPECT_EQ(served, std::vector<std::uint32_t>{5});
+}
+
+}  // namespace
+}  // namespace brenvik

@@ -1,0 +1,123 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/worker/linux/WorkerRights.h"
+
+#include <grp.h>
+#include <linux/capability.h>
+#include <pwd.h>
+#include <sys/prctl.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <new>
+#include <optional>
+
+namespace brenvik {
+namespace {
+
+struct Ids {
+  uid_t uid;
+  gid_t gid;
+};
+
+// Looked up while this process has no other thread.
+std::optional<Ids> accountFor(const WorkerRights& rights) {
+  for (const std::string& name : rights.accounts) {
+    if (const passwd* const entry = ::getpwnam(name.c_str()); entry != nullptr)
+      return Ids{entry->pw_uid, entry->pw_gid};
+  }
+  if (rights.otherwise == static_cast<uid_t>(-1)) return std::nullopt;
+  return Ids{rights.otherwise, rights.otherwise};
+}
+
+bool setCapabilities(const std::vector<int>& kept) noexcept {
+  __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+  __user_cap_data_struct data[_LINUX_CAPABILITY_U32S_3] = {};
+  for (const int capability : kept) {
+    const unsigned bit = 1U << (static_cast<unsigned>(capability) % 32);
+    data[capability / 32].permitted |= bit;
+    data[capability / 32].effective |= bit;
+  }
+  return ::syscall(SYS_capset, &header, data) == 0;
+}
+
+bool hasOnly(const std::vector<int>& kept) noexcept {
+  __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+  __user_cap_data_struct data[_LINUX_CAPABILITY_U32S_3] = {};
+  if (::syscall(SYS_capget, &header, data) != 0) return false;
+  for (const int capability : kept)
+    data[capability / 32].permitted &= ~(1U << (static_cast<unsigned>(capability) % 32));
+  return data[0].permitted == 0 && data[1].permitted == 0 && data[0].inheritable == 0 &&
+         data[1].inheritable == 0;
+}
+
+// Whether the numbers exist in this process's user namespace: the kernel refuses the others as invalid.
+enum class Became { account, onlyAccount, nothing };
+Became become(const Ids& ids) noexcept {
+  const bool hasNoGroups = ::setgroups(0, nullptr) == 0;
+  const bool isOfGroup = ::setresgid(ids.gid, ids.gid, ids.gid) == 0;
+  if (::setresuid(ids.uid, ids.uid, ids.uid) != 0)
+    return errno == EINVAL ? Became::onlyAccount : Became::nothing;
+  return hasNoGroups && isOfGroup ? Became::account : Became::nothing;
+}
+
+bool isOrdinaryForGood() noexcept {
+  uid_t uids[3];
+  gid_t gids[3];
+  if (::getresuid(&uids[0], &uids[1], &uids[2]) != 0 || ::getresgid(&gids[0], &gids[1], &gids[2]) != 0)
+    return false;
+  for (const uid_t uid : uids) {
+    if (uid == 0) return false;
+  }
+  for (const gid_t gid : gids) {
+    if (gid == 0) return false;
+  }
+  return ::setresuid(0, 0, 0) != 0 && ::setresgid(0, 0, 0) != 0;
+}
+
+bool limit(__rlimit_resource what, rlim_t value) noexcept {
+  const rlimit both{value, value};
+  return ::setrlimit(what, &both) == 0;
+}
+
+}  // namespace
+
+const char* giveUpRights(const WorkerRights& rights) noexcept {
+  std::vector<int> kept;
+  try {
+    if (::geteuid() == 0 || ::getuid() == 0) {
+      const std::optional<Ids> ids = accountFor(rights);
+      if (!ids) return "the account does not exist";
+      if (ids->uid == 0 || ids->gid == 0) return "the account is root's";
+      if (rights.keptCapabilities) kept = rights.keptCapabilities(ids->gid);
+      // Else they go with the account.
+      if (!kept.empty() && ::prctl(PR_SET_KEEPCAPS, 1, 0, 0, 0) != 0) return "no capability can be kept";
+      const Became became = become(*ids);
+      if (became == Became::nothing) return "root's account cannot be left";
+      if (became == Became::account) {
+        // Before the way back is tried, which they would open.
+        if (!setCapabilities(kept)) return "capabilities cannot be dropped";
+        if (!isOrdinaryForGood()) return "root's account can be had again";
+      }
+    } else if (rights.keptCapabilities) {
+      // The service manager has said already what it may keep.
+      kept = rights.keptCapabilities(::getegid());
+      if (!setCapabilities(kept)) kept.clear();
+    }
+  } catch (const std::bad_alloc&) {
+    return "out of memory";
+  }
+  (void)::prctl(PR_CAP_AMBIENT, PR_CAP_AMBIENT_CLEAR_ALL, 0, 0, 0);  // kernels without them have none
+  if (!setCapabilities(kept) || !hasOnly(kept)) return "capabilities cannot be dropped";
+  if (::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) return "new privileges cannot be refused";
+  if (::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0) != 0) return "other processes can look into it";
+  if (!limit(RLIMIT_CORE, 0) || !limit(RLIMIT_NOFILE, rights.descriptors)) return "it cannot be limited";
+#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
+  if (rights.addressSpace != 0 && !limit(RLIMIT_AS, rights.addressSpace))
+    return "its memory cannot be limited";
+#endif
+  return nullptr;
+}
+
+}  // namespace brenvik

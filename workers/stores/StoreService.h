@@ -1,0 +1,15 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstdint>
+
+#include "platform/worker/WorkerChannel.h"
+
+namespace brenvik {
+
+// Serves one channel of the helper with the voicemail store or the contacts until it hangs up, or sends what
+// is no request: then this end hangs up. On a thread of its own.
+void serveStore(std::uint32_t work, WorkerChannel channel) noexcept;
+
+}  // namespace brenvik

@@ -1,0 +1,354 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+// The stores on both sides of a channel: the helper's end, the service on a thread, and the real program.
+#include "workers/stores/StoreService.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/files/fakes/TemporaryDirectory.h"
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/sqlite/Sqlite.h"
+#include "platform/stores/RemoteContacts.h"
+#include "platform/stores/RemoteVoicemailStore.h"
+#include "platform/stores/StoreMessages.h"
+#include "platform/stores/linux/PreparedFolder.h"
+#include "platform/worker/WorkerFields.h"
+#include "platform/worker/fakes/ThreadedWorker.h"
+#include "platform/worker/linux/WorkerProgram.h"
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+using Clock = std::chrono::steady_clock;
+using Error = RecordingLog::Entry;
+
+constexpr auto kForEver = Clock::time_point::max();
+
+Error errorLine(const std::string& text) { return RecordingLog::unifiedLine(LogLevel::error, text); }
+
+class StoresTest : public testing::Test {
+ protected:
+  explicit StoresTest(std::string path = {}) : homePath(path.empty() ? home.path() : std::move(path)) {}
+
+  PreparedFolder folder(const char* name, const char* file) {
+    return {[this] { return PreparedFolder::Account{homePath, ::getuid(), ::getgid()}; }, name, file};
+  }
+  void run(const std::string& file, const std::string& statements) {
+    sqlite3* opened = nullptr;
+    ASSERT_EQ(sqlite()->open_v2(file.c_str(), &opened, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr),
+              SQLITE_OK);
+    const SqliteDatabase database(opened);
+    ASSERT_EQ(sqlite()->exec(opened, statements.c_str(), nullptr, nullptr, nullptr), SQLITE_OK)
+        << sqlite()->errmsg(opened);
+  }
+  void makeContacts(const std::string& more = "") {
+    home.directory("Library/AddressBook");
+    run(contactsFile,
+        "CREATE TABLE contact_channels(contact_id INTEGER NOT NULL, channel_identifier TEXT NOT NULL);"
+        "INSERT INTO contact_channels VALUES(1,'old'),(2,'other');" +
+            more);
+  }
+  static std::string remap(ContactsService& contacts, const std::string& from = "old",
+                           const std::string& to = "new") {
+    bool lackedMemory = false;
+    const auto manager = contacts.makeChannelManager(&lackedMemory);
+    if (lackedMemory) return "no memory";
+    if (manager == nullptr) return "no manager";
+    std::optional<std::string> error;
+    return manager->remapChannelIdentifier(from, to, &error) ? "success" : error.value_or("(none)");
+  }
+
+  TemporaryDirectory home;
+  const std::string homePath;
+  const std::string voicemailFile = home / "Library/Voicemail/voicemail.db";
+  const std::string contactsFile = home / "Library/AddressBook/contacts.db";
+  PreparedFolder voicemailFolder = folder("Voicemail", stores::kVoicemailFile);
+  PreparedFolder contactsFolder = folder("AddressBook", stores::kContactsFile);
+  RecordingLog log;
+  const std::string token = "token";
+};
+
+// ---- over the service on a thread
+
+class StoreServiceTest : public StoresTest {
+ protected:
+  ThreadedWorker worker{&serveStore};
+  RemoteVoicemailStore store{worker, voicemailFolder};
+  RemoteContacts contacts{worker, contactsFolder};
+};
+
+TEST_F(StoreServiceTest, TokensAreKeptReplacedAndClearedOverOneChannel) {
+  const std::string second = "sécond 'quoted' \xF0\x9F\x98\x80";
+  EXPECT_TRUE(store.setToken(&token));
+  EXPECT_TRUE(store.setToken(&second));
+  EXPECT_TRUE(store.setTokenForKey("a", "1"));
+  EXPECT_TRUE(store.setTokenForKey("", "empty key"));
+  EXPECT_TRUE(store.setTokenForKey("b", ""));
+  EXPECT_EQ(store.copyToken(), second);
+  EXPECT_EQ(store.copyTokenForKey("a"), "1");
+  EXPECT_EQ(store.copyTokenForKey(""), "empty key");
+  EXPECT_EQ(store.copyTokenForKey("b"), "");
+  EXPECT_EQ(store.copyTokenForKey("c"), std::nullopt);
+  EXPECT_TRUE(store.setToken(nullptr));
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  EXPECT_TRUE(store.removeAllRecords());
+  EXPECT_EQ(store.copyTokenForKey("a"), std::nullopt);
+  EXPECT_EQ(worker.opened(), 1);
+  EXPECT_TRUE(log.entries().empty());
+  EXPECT_EQ(statOf(voicemailFile).st_mode & 07777U, 0600U);
+}
+
+TEST_F(StoreServiceTest, ReadingAStoreThatIsNotThereAsksNobody) {
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  EXPECT_EQ(remap(contacts), "no manager");
+  EXPECT_EQ(worker.opened(), 0);
+  EXPECT_FALSE(isThere(home / "Library"));
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(StoreServiceTest, AFolderThatWasReplacedIsTheOneThatCounts) {
+  EXPECT_TRUE(store.setToken(&token));
+  std::filesystem::rename(home / "Library/Voicemail", home / "moved");
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  const std::string second = "second";
+  EXPECT_TRUE(store.setToken(&second));
+  EXPECT_EQ(store.copyToken(), second);
+  std::filesystem::remove_all(home / "Library");
+  std::filesystem::create_directory(home / "Library");
+  std::filesystem::rename(home / "moved", home / "Library/Voicemail");
+  EXPECT_EQ(store.copyToken(), token);
+  EXPECT_EQ(worker.opened(), 1);
+}
+
+TEST_F(StoreServiceTest, AWorkerThatIsGoneBetweenTwoOperationsIsReplacedAndNobodyNotices) {
+  EXPECT_TRUE(store.setToken(&token));
+  for (int i = 0; i < 10; ++i) {
+    worker.die();
+    EXPECT_EQ(store.copyToken(), token);
+  }
+  EXPECT_EQ(worker.opened(), 11);
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(StoreServiceTest, WithoutAWorkerItIsAStoreThatCannotBeOpened) {
+  home.directory("Library/Voicemail");
+  makeContacts();
+  worker.answerWith(WorkerResult::unavailable);
+  EXPECT_TRUE(store.setToken(&token));
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  EXPECT_EQ(remap(contacts), "the contacts could not be reached");
+  EXPECT_EQ(log.entries(), std::vector({errorLine("The voicemail store could not be written"),
+                                        errorLine("The voicemail store could not be read")}));
+  worker.answerWith(WorkerResult::outOfMemory);
+  EXPECT_FALSE(store.setToken(&token));
+  EXPECT_EQ(remap(contacts), "no memory");
+  worker.answerWith(WorkerResult::done);
+  EXPECT_TRUE(store.setToken(&token));
+  EXPECT_EQ(store.copyToken(), token);
+  EXPECT_EQ(remap(contacts), "success");
+}
+
+TEST_F(StoreServiceTest, ContactsFollowTheirChannelAndFailuresKeepTheirDescription) {
+  makeContacts(
+      "CREATE TRIGGER t BEFORE UPDATE ON contact_channels WHEN new.channel_identifier = 'refused' "
+      "BEGIN SELECT RAISE(FAIL, 'contact 1 is frozen'); END;");
+  EXPECT_EQ(remap(contacts), "success");
+  EXPECT_EQ(remap(contacts, "new", "refused"), "contact 1 is frozen");
+  EXPECT_EQ(remap(contacts, "new", "\xFF"), "a channel identifier is not valid UTF-8");
+  const auto manager = contacts.makeChannelManager();
+  ASSERT_NE(manager, nullptr);
+  std::optional<std::string> error;
+  EXPECT_FALSE(manager->remapChannelIdentifier("new", "refused", &error));
+  EXPECT_TRUE(manager->remapChannelIdentifier("new", "newer", &error)) << "it works again after a failure";
+}
+
+TEST_F(StoreServiceTest, ADescriptionWithoutEndIsCut) {
+  makeContacts("CREATE TRIGGER t BEFORE UPDATE ON contact_channels BEGIN SELECT RAISE(FAIL, '" +
+               std::string(30'000, 'x') + "'); END;");
+  EXPECT_EQ(remap(contacts), std::string(stores::kLongestDescription, 'x'));
+}
+
+TEST_F(StoreServiceTest, AMissingDatabaseAndOneThatIsNoneGiveNoManager) {
+  home.directory("Library/AddressBook");
+  EXPECT_EQ(remap(contacts), "no manager");
+  home.file("Library/AddressBook/contacts.db", std::string(4096, 'x'));
+  EXPECT_EQ(remap(contacts), "no manager");
+}
+
+// ---- over a worker that does not keep to the agreement
+
+class LyingWorkerTest : public StoresTest {
+ protected:
+  LyingWorkerTest() {
+    home.directory("Library/Voicemail");
+    makeContacts();
+  }
+  // Runs all operations; each must come to its end in time, whatever the worker does.
+  void expectFailures(const ThreadedWorker::Serve& serve, const std::string& remapError) {
+    ThreadedWorker worker(serve);
+    RemoteVoicemailStore store(worker, voicemailFolder, 50ms);
+    RemoteContacts contacts(worker, contactsFolder, 50ms);
+    log.clear();
+    const auto before = Clock::now();
+    for (int i = 0; i < 10; ++i) {
+      (void)store.setToken(&token);
+      EXPECT_EQ(store.copyToken(), std::nullopt);
+      EXPECT_EQ(remap(contacts), remapError);
+    }
+    EXPECT_LT(Clock::now() - before, 30s);
+    std::vector<Error> expected;
+    for (int i = 0; i < 10; ++i) {
+      expected.push_back(errorLine("The voicemail store could not be written"));
+      expected.push_back(errorLine("The voicemail store could not be read"));
+    }
+    EXPECT_EQ(log.entries(), expected);
+    EXPECT_EQ(worker.givenUp(), 30);
+  }
+};
+
+TEST_F(LyingWorkerTest, OneThatDiesAtEachRequest) {
+  expectFailures(
+      [](std::uint32_t, WorkerChannel channel) {
+        WorkerMessage message;
+        (void)channel.receive(&message, kForEver);
+      },
+      "the contacts could not be reached");
+}
+
+TEST_F(LyingWorkerTest, OneThatNeverAnswers) {
+  expectFailures(
+      [](std::uint32_t, WorkerChannel channel) {
+        WorkerMessage message;
+        while (channel.receive(&message, kForEver) == WorkerResult::done) {
+        }
+      },
+      "the contacts did not answer in time");
+}
+
+TEST_F(LyingWorkerTest, OneWhoseAnswersAreNone) {
+  for (const std::uint32_t kind : {0U, 1U, 3U, 4U, 0xFFFFFFFFU}) {
+    expectFailures(
+        [kind](std::uint32_t, WorkerChannel channel) {
+          WorkerMessage message;
+          while (channel.receive(&message, kForEver) == WorkerResult::done) {
+            message.kind = kind;
+            message.payload.assign(9, std::byte{0xAA});
+            message.descriptors.clear();
+            if (channel.send(message) != WorkerResult::done) return;
+          }
+        },
+        "the contacts could not be reached");
+  }
+}
+
+TEST_F(LyingWorkerTest, OneThatFloods) {
+  expectFailures(
+      [](std::uint32_t, WorkerChannel channel) {
+        WorkerMessage message;
+        message.payload.resize(WorkerMessage::kLongestPayload);
+        for (int i = 0; i < 3; ++i) message.descriptors.emplace_back(::dup(STDERR_FILENO));
+        while (channel.send(message) == WorkerResult::done || message.kind == 0) {
+          if (channel.receive(&message, Clock::now()) == WorkerResult::closed) return;
+          message.payload.resize(WorkerMessage::kLongestPayload);
+        }
+      },
+      "the contacts could not be reached");
+}
+
+// An answer that comes too late is not taken for the next one's.
+TEST_F(LyingWorkerTest, OneThatAnswersTwice) {
+  ThreadedWorker worker([](std::uint32_t, WorkerChannel channel) {
+    WorkerMessage message;
+    while (channel.receive(&message, kForEver) == WorkerResult::done) {
+      const auto request = stores::decodeVoicemailRequest(message);
+      const auto answer = stores::encode(stores::VoicemailAnswer{
+          .outcome = stores::VoicemailOutcome::done, .serial = request->serial, .token = request->key});
+      (void)channel.send(answer);
+      (void)channel.send(answer);
+    }
+  });
+  RemoteVoicemailStore store(worker, voicemailFolder);
+  EXPECT_EQ(store.copyTokenForKey("first"), "first");
+  EXPECT_EQ(store.copyTokenForKey("second"), std::nullopt);
+  EXPECT_EQ(store.copyTokenForKey("third"), "third");
+}
+
+// ---- what the service makes of requests that are none
+
+TEST_F(StoresTest, WhatIsNoRequestHangsUp) {
+  const auto hangsUp = [&](std::uint32_t work, WorkerMessage message) {
+    ThreadedWorker worker{&serveStore};
+    WorkerChannel channel;
+    EXPECT_EQ(worker.open(work, &channel), WorkerResult::done);
+    (void)channel.send(message);  // it may have hung up already
+    return channel.receive(&message, Clock::now() + 20s) == WorkerResult::closed;
+  };
+  const auto withFolder = [&](WorkerMessage message, const std::string& path) {
+    message.descriptors.emplace_back(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    return message;
+  };
+  EXPECT_TRUE(hangsUp(0, {}));
+  EXPECT_TRUE(hangsUp(3, {}));
+  EXPECT_TRUE(hangsUp(1, {}));
+  EXPECT_TRUE(hangsUp(2, {}));
+  const stores::VoicemailRequest request;
+  EXPECT_TRUE(hangsUp(1, stores::encode(request))) << "without a folder";
+  EXPECT_TRUE(hangsUp(1, withFolder(stores::encode(request), "/etc/passwd")));
+  EXPECT_TRUE(hangsUp(1, withFolder(withFolder(stores::encode(request), home.path()), home.path())));
+  WorkerMessage opening;
+  opening.kind = stores::kOpenContacts;
+  EXPECT_TRUE(hangsUp(2, withFolder(std::move(opening), "/etc/passwd")));
+  EXPECT_TRUE(hangsUp(2, stores::encode(stores::RemapRequest{"a", "b"}))) << "before a folder";
+}
+
+// ---- over the program itself
+
+class StoreWorkerTest : public StoresTest {
+ protected:
+  static WorkerProgram::Description description(const std::string& bootstrap) {
+    return {.service = stores::kService,
+            .program = stores::kProgram,
+            .bootstrap = bootstrap,
+            .folders = {BRENVIK_TEST_WORKER_FOLDER}};
+  }
+  static bool canRun() {
+    // Started by root, it becomes "mobile", which not every machine has.
+    return ::geteuid() != 0 || ::system("getent passwd mobile > /dev/null") == 0;
+  }
+};
+
+TEST_F(StoreWorkerTest, TheProgramKeepsTheStoresAndLeavesWithItsOwner) {
+  if (::geteuid() == 0) GTEST_SKIP() << "the end-to-end tests have an account \"mobile\"";
+  WorkerProgram worker(description(home.path()));
+  RemoteVoicemailStore store(worker, voicemailFolder, 20s);
+  RemoteContacts contacts(worker, contactsFolder, 20s);
+  makeContacts();
+  EXPECT_TRUE(store.setToken(&token));
+  EXPECT_EQ(store.copyToken(), token);
+  EXPECT_EQ(remap(contacts), "success");
+}
+
+TEST_F(StoreWorkerTest, WithoutTheAccountItDoesNotRunAndTheStoreCannotBeWritten) {
+  if (canRun()) GTEST_SKIP() << "there is an account \"mobile\", or this is not root";
+  WorkerProgram worker(description(home.path()));
+  RemoteVoicemailStore store(worker, voicemailFolder, 20s);
+  EXPECT_TRUE(store.setToken(&token));
+  ASSERT_EQ(log.entries().size(), 2U);
+  EXPECT_EQ(log.entries()[1], errorLine("The voicemail store could not be written"));
+  EXPECT_FALSE(isThere(voicemailFile));
+}
+
+}  // namespace
+}  // namespace brenvik
