@@ -11,7 +11,6 @@ import errno
 import json
 import os
 import socket
-import stat
 import sys
 
 LIBC = ctypes.CDLL(None, use_errno=True)
@@ -53,21 +52,21 @@ def takes_descriptor(process):
     call(PIDFD_GETFD, pidfd, 0, 0)
 
 
-def writable_places():
-    """Every folder in which a file could be made, without those inside another one of them."""
-    found = []
-    for folder, folders, _ in os.walk("/"):
-        if os.access(folder, os.W_OK) and os.path.realpath(folder) == folder:
-            found.append(folder)
-            folders.clear()
-        folders[:] = [each for each in folders if os.path.join(folder, each) != "/proc"]
-    return sorted(found)
-
-
 def written(folder):
     path = os.path.join(folder, "brenvik-probe")
     os.close(os.open(path, os.O_WRONLY | os.O_CREAT | os.O_EXCL, 0o600))
     os.unlink(path)
+
+
+def writable_places():
+    """Every folder in which a file could be made, without those inside another one of them."""
+    found = []
+    for folder, folders, _ in os.walk("/"):
+        if attempt(written, folder) == "done":
+            found.append(folder)
+            folders.clear()
+        folders[:] = [each for each in folders if os.path.join(folder, each) != "/proc"]
+    return sorted(found)
 
 
 def main():
@@ -86,16 +85,12 @@ def main():
         "packet": attempt(opens_socket, socket.AF_PACKET, socket.SOCK_RAW),
         "raw": attempt(socket.socket, socket.AF_INET, socket.SOCK_RAW, socket.IPPROTO_ICMP)
                if attempt(opens_socket, socket.AF_INET, socket.SOCK_DGRAM) == "done" else "no network",
-        "interfaces": attempt(lambda: sorted(name for _, name in socket.if_nameindex())),
         "root_account": attempt(os.setresuid, 0, 0, 0) if os.geteuid() != 0 else "done",
         "writable": writable_places(),
         "settings": attempt(lambda: os.close(os.open("/proc/sys/kernel/core_pattern", os.O_WRONLY))),
     }
     for folder in ("/home", "/root", "/var/mobile", "/run/user", "/tmp"):
         result["sees " + folder] = attempt(lambda: sorted(os.listdir(folder)))
-    # What looks writable is.
-    result["written"] = {folder: attempt(written, folder) for folder in result["writable"]
-                         if stat.S_ISDIR(os.stat(folder).st_mode)}
     # The way around: another process's root, and what is mounted there.
     result["around"] = attempt(lambda: sorted(os.listdir("/proc/1/root/home")))
     result["memory_around"] = attempt(writes_memory, f"/proc/1/root/proc/{victim}/mem")
