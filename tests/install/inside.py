@@ -437,6 +437,11 @@ def works_for_the_whole_phone():
                 connection.settimeout(10)
                 callers.append(struct.unpack("iII", connection.getsockopt(socket.SOL_SOCKET, socket.SO_PEERCRED, 12))[0])
                 expect(connection.recv(64).startswith(b"\0AUTH"), "whoever connects speaks to the bus")
+        # A queue for "utility" work, which the unit lets lower its own priority.
+        tasks = pathlib.Path(f"/proc/{helper}/task").iterdir()
+        niceness = [int((task / "stat").read_text().rpartition(")")[2].split()[16]) for task in tasks
+                    if (task / "comm").read_text() == "RadioManagerLog\n"]
+        expect_equal(niceness, [10])
     os.unlink("/run/dbus/system_bus_socket")
     expect_equal(served_by("store"), "mobile", "who has the databases")
 
