@@ -30,6 +30,7 @@ import zlib
 SERVICE = "brenvik-mobile-helper.service"
 SOCKET = "brenvik-mobile-helper.socket"
 PATH = "/run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper"
+WORKERS = {"network": PATH + ".network", "store": PATH + ".stores"}
 IDLE = 10.0
 
 
@@ -109,13 +110,15 @@ class Library:
         self.lib = ctypes.CDLL("libbrenvik-mobile-helper.so.0")
         self.lib.bvmh_client_create.restype = ctypes.c_void_p
         self.lib.bvmh_error_text.restype = ctypes.c_char_p
-        for name in ("bvmh_client_free", "bvmh_connect", "bvmh_client_set_socket", "BVMobileHelperCopyVoicemailToken"):
+        for name in ("bvmh_client_free", "bvmh_connect", "bvmh_client_set_socket", "BVMobileHelperCopyVoicemailToken",
+                     "BVMobileHelperCopyCountryCode"):
             getattr(self.lib, name).argtypes = [ctypes.c_void_p]
         self.lib.bvmh_client_set_socket.argtypes = [ctypes.c_void_p, ctypes.c_char_p]
-        self.lib.BVMobileHelperCopyVoicemailToken.argtypes = [ctypes.c_void_p, ctypes.c_char_p, ctypes.c_size_t]
+        for name in ("BVMobileHelperCopyVoicemailToken", "BVMobileHelperCopyCountryCode"):
+            getattr(self.lib, name).argtypes = [ctypes.c_void_p, ctypes.c_char_p, ctypes.c_size_t]
 
-    def request(self, path):
-        """One client, one check-in, one request. Returns the code and the token."""
+    def request(self, path, routine="BVMobileHelperCopyVoicemailToken"):
+        """One client, one check-in, one request. Returns the code and the text that is answered."""
         client = self.lib.bvmh_client_create()
         try:
             code = self.lib.bvmh_client_set_socket(client, path.encode())
@@ -123,7 +126,7 @@ class Library:
             if code == 0:
                 code = self.lib.bvmh_connect(client)
             if code == 0:
-                code = self.lib.BVMobileHelperCopyVoicemailToken(client, buffer, 257)
+                code = getattr(self.lib, routine)(client, buffer, 257)
             return code, buffer.value.decode()
         finally:
             self.lib.bvmh_client_free(client)
@@ -281,9 +284,18 @@ def everything():
     return found
 
 
+def workers_listen():
+    for worker, path in WORKERS.items():
+        listening = f"brenvik-{worker}-worker.socket"
+        expect_equal((property_of(listening, "ActiveState"), property_of(listening, "UnitFileState")), ("active", "enabled"),
+                     listening)
+        facts = os.stat(path)
+        expect_equal((facts.st_uid, facts.st_gid, stat.S_IMODE(facts.st_mode)), (0, 0, 0o600), path)
+
+
 def install():
     BEFORE.update(everything())
-    packages = [each for each in glob.glob("/packages/*.deb") if "upgrade" not in each]
+    packages = glob.glob("/packages/*_*.deb")
     run("dpkg", "-i", *packages, env={**os.environ, "DEBIAN_FRONTEND": "noninteractive"})
     expect_equal(property_of(SOCKET, "ActiveState"), "active", SOCKET)
     expect_equal(property_of(SOCKET, "UnitFileState"), "enabled", SOCKET)
@@ -291,12 +303,13 @@ def install():
     facts = os.stat(PATH)
     expect_equal((facts.st_uid, facts.st_gid, stat.S_IMODE(facts.st_mode)), (0, grp.getgrnam("brenvik").gr_gid, 0o660),
                  "owner, group and mode of the socket")
+    workers_listen()
     mobile = pwd.getpwnam("mobile")
     expect_equal(mobile.pw_dir, "/var/mobile")
     expect_equal(os.stat("/var/mobile").st_uid, mobile.pw_uid)
     expect(os.path.samefile("/private/var/mobile", "/var/mobile"), "/private/var leads to /var")
-    # The heartbeat's ping sockets, for which the service has no other right.
-    expect_equal(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").read_text().split(), ["0", "0"], "ping sockets")
+    # The heartbeat's ping sockets, for which the network worker has no other right.
+    expect_equal(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").read_text().split(), ["0", "2147483647"], "ping sockets")
     socket.socket(socket.AF_INET, socket.SOCK_DGRAM, socket.IPPROTO_ICMP).close()
     expect_equal(run("dpkg", "-V", *PACKAGES, check=False).stdout, "", "dpkg --verify")
     for folder in ("/etc/brenvik/entitlements.d", "/usr/lib/brenvik/entitlements.d"):
@@ -362,6 +375,21 @@ def works_in_its_sandbox():
     expect_equal(bvhelperctl("labels", "localized", "--language", "de", "--label", "travel").stdout, "Reise\n")
 
 
+def served_by(worker):
+    """The account of a worker that is at work."""
+    process = int(property_of(f"brenvik-{worker}-worker.service", "MainPID"))
+    expect(process > 0, f"brenvik-{worker}-worker.service is at work")
+    fields = dict(line.split(":\t") for line in pathlib.Path(f"/proc/{process}/status").read_text().splitlines() if ":\t" in line)
+    for each in ("CapInh", "CapPrm", "CapEff", "CapBnd", "CapAmb"):
+        expect_equal(int(fields[each], 16), 0, f"{worker}: {each}")
+    expect_equal((fields["NoNewPrivs"], fields["Seccomp"]), ("1", "2"), f"{worker}: no new privileges, a filter")
+    account = int(fields["Uid"].split()[0])
+    try:
+        return pwd.getpwuid(account).pw_name
+    except KeyError:
+        return account
+
+
 def works_for_the_whole_phone():
     """The routines whose work lies in files of others, in libraries that are not there, on the system bus."""
     pathlib.Path("/var/lib/brenvik/Library/Preferences").mkdir(parents=True, exist_ok=True)
@@ -414,6 +442,7 @@ def works_for_the_whole_phone():
                     if (task / "comm").read_text() == "RadioManagerLog\n"]
         expect_equal(niceness, [10])
     os.unlink("/run/dbus/system_bus_socket")
+    expect_equal(served_by("store"), "mobile", "who has the databases")
 
 
 def asks_the_network():
@@ -446,6 +475,11 @@ def asks_the_network():
         bvhelperctl("location", "civic", "59.9133", "10.739")
         kind, values = heard()
         expect_equal((kind, values["CountryCode"], values["City"]), ("civic-info", "NO", "Oslo"))
+    account = served_by("network")
+    expect(account not in ("root", "mobile", 0), f"who has the network: {account}")
+    process = int(property_of("brenvik-network-worker.service", "MainPID"))
+    niceness = int(pathlib.Path(f"/proc/{process}/stat").read_text().rpartition(")")[2].split()[16])
+    expect_equal(niceness, 10, "the priority of what the helper calls utility work")
     expect_equal(pathlib.Path("/var/mobile/Library/LASD/gsm.db").read_bytes(), content)
     expect_equal(plistlib.loads(pathlib.Path("/root/Library/Preferences/com.norvale.lasd.plist").read_bytes()), manifest)
 
@@ -543,6 +577,94 @@ def held_in_its_sandbox():
     expect_equal((fields["NoNewPrivs"], fields["Seccomp"]), ("1", "2"), "no new privileges, a filter")
     # Privileges of the archive reader are looked at by its tests; here: it was started in the same sandbox.
     expect("ArkCopier signaled fatal file error" in log_of_the_helper(), "the refused archive is in the log")
+
+
+def probed(unit):
+    """What came of a program's attempts in the place of a service: see probe.py."""
+    folder = pathlib.Path(f"/run/systemd/system/{unit}.d")
+    folder.mkdir(parents=True)
+    output = pathlib.Path("/run/brenvik-probe.json")
+    # Where every service can read it, and with an end of its own.
+    program = pathlib.Path("/usr/local/lib/brenvik-probe.py")
+    program.write_bytes(pathlib.Path("/test/probe.py").read_bytes())
+    program.chmod(0o644)
+    victim = subprocess.Popen(["sleep", "60"])
+    try:
+        (folder / "probe.conf").write_text(f"[Service]\nType=oneshot\nExecStart=\nExecStart=/usr/bin/python3 -E -s {program} "
+                                           f"{victim.pid}\nStandardOutput=truncate:{output}\nTimeoutStartSec=30s\n")
+        run("systemctl", "daemon-reload")
+        run("systemctl", "stop", unit)
+        run("systemctl", "start", unit)
+        return json.loads(output.read_text())
+    finally:
+        victim.kill()
+        victim.wait()
+        (folder / "probe.conf").unlink()
+        folder.rmdir()
+        program.unlink()
+        output.unlink(missing_ok=True)
+        run("systemctl", "daemon-reload")
+
+
+def expect_refused(found, **wanted):
+    for key, error in wanted.items():
+        expect_equal(found[key], error, key)
+
+
+# Nothing of another process can be had, and no file system setting changed.
+OF_OTHERS = {"vm_write": "EPERM", "vm_read": "EPERM", "ptrace": "EPERM", "take_descriptor": "EPERM", "settings": "ENOENT"}
+NO_NETWORK = {"inet": "EAFNOSUPPORT", "inet6": "EAFNOSUPPORT", "netlink": "EAFNOSUPPORT", "packet": "EAFNOSUPPORT",
+              "raw": "no network"}
+
+
+@contextlib.contextmanager
+def a_home_with_a_secret():
+    pathlib.Path("/home/somebody").mkdir()
+    try:
+        yield
+    finally:
+        pathlib.Path("/home/somebody").rmdir()
+
+
+def a_helper_that_was_taken_over_is_held():
+    with a_home_with_a_secret():
+        found = probed(SERVICE)
+    expect_refused(found, memory="EROFS", **OF_OTHERS, **NO_NETWORK)
+    expect_equal((found["sees /home"], found["sees /root"], found["sees /run/user"]), ([], ["Library"], []), "homes")
+    expect_equal([each for each in found["writable"] if not each.startswith("/dev/")],
+                 ["/root/Library", PATH.rpartition("/")[0], "/tmp", "/var/lib/brenvik", "/var/mobile", "/var/tmp"],
+                 "places where it could write a file")
+    # What is still open, as SECURITY.md says: reading which program a caller runs takes a capability that also lets it go
+    # through another process's root folder, to what is mounted there. Whoever closes that changes the page.
+    expect_equal((found["around"], found["memory_around"]), (["somebody"], "done"), "the way around through /proc/PID/root")
+
+
+def a_network_worker_that_was_taken_over_is_held():
+    with a_home_with_a_secret():
+        found = probed("brenvik-network-worker.service")
+    expect_refused(found, memory="ENOENT", signal="EPERM", packet="EAFNOSUPPORT", raw="EPERM", root_account="EPERM",
+                   around="ENOENT", memory_around="ENOENT", **OF_OTHERS)
+    expect_equal(found["writable"], [], "places where it could write a file")
+    expect_equal((found["sees /home"], found["sees /root"], found["sees /var/mobile"], found["sees /tmp"]), ("EACCES",) * 4,
+                 "homes and packages")
+
+
+def a_store_worker_that_was_taken_over_is_held():
+    with a_home_with_a_secret():
+        found = probed("brenvik-store-worker.service")
+    expect_refused(found, memory="ENOENT", signal="EPERM", root_account="EPERM", around="ENOENT", memory_around="ENOENT",
+                   **OF_OTHERS, **NO_NETWORK)
+    expect_equal(found["writable"], [], "places where it could write a file")
+    expect_equal((found["sees /home"], found["sees /root"], found["sees /var/mobile"], found["sees /tmp"]),
+                 ("EACCES", "EACCES", "ENOENT", "EACCES"), "homes and packages")
+
+
+def only_root_reaches_a_worker():
+    for path in WORKERS.values():
+        done = run("setpriv", "--reuid=mobile", "--regid=mobile", "--groups", "brenvik", sys.executable, "-c",
+                   "import socket, sys; socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET).connect(sys.argv[1])", path,
+                   check=False)
+        expect(done.returncode != 0 and "PermissionError" in done.stderr, f"mobile at {path}: {done.stderr}")
 
 
 def other_accounts_are_told_apart():
@@ -682,6 +804,7 @@ def nothing_is_lost_at_the_idle_edge():
     names = [f"edge@{i}.socket" for i in range(instances)]
     run("systemctl", "start", *names)
     library = Library()
+    routine = "BVMobileHelperCopyCountryCode"  # no worker's work: one worker does not serve fifty helpers
     run("systemctl", "stop", SERVICE)
     began = time.monotonic()
     expect_equal(library.request(PATH), (0, "a-token"), "a request that starts the helper")
@@ -696,14 +819,14 @@ def nothing_is_lost_at_the_idle_edge():
         nonlocal busy
         path = f"/run/edge/{number}"
         time.sleep(max(0.0, began + number * spacing - time.monotonic()))
-        expect_equal(library.request(path), (0, "a-token"), f"first request of {number}")
+        expect_equal(library.request(path, routine), (0, "NO"), f"first request of {number}")
         edge = time.monotonic() + IDLE
         before = property_of(f"edge@{number}.service", "MainPID")
         time.sleep(max(0.0, edge - 0.1 - time.monotonic()))
         first = busy - 0.005 + 0.040 * (number * 37 % instances) / instances
         for turn in range(each_time):
             time.sleep(max(0.0, edge + first + turn * 0.004 - time.monotonic()))
-            answers[number].append(library.request(path))
+            answers[number].append(library.request(path, routine))
         met = property_of(f"edge@{number}.service", "MainPID") != before
         busy = max(0.0, busy + (-0.005 if met else 0.02))
 
@@ -714,7 +837,7 @@ def nothing_is_lost_at_the_idle_edge():
         thread.join()
     flat = [answer for answers_of_one in answers for answer in answers_of_one]
     expect_equal(len(flat), instances * each_time, "requests")
-    wrong = [answer for answer in flat if answer != (0, "a-token")]
+    wrong = [answer for answer in flat if answer != (0, "NO")]
     expect(not wrong, f"{len(wrong)} of {len(flat)} lost: {wrong[:5]}")
     starts = starts_of("edge@*.service")
     print(f"    {len(flat)} requests, none lost; {starts} starts of {instances} instances", flush=True)
@@ -765,6 +888,7 @@ def upgrade():
         process = property_of(SERVICE, "MainPID")
         run("dpkg", "-i", "/packages/upgrade.deb")
         expect_equal(property_of(SOCKET, "ActiveState"), "active", "listens on")
+        workers_listen()
         expect_equal(property_of(SERVICE, "MainPID"), process, "a helper at work is left alone")
     expect_equal(ping_sockets.read_text().split(), ["0", "7"], "ping sockets that the administrator has opened")
     expect_equal(run("dpkg", "-V", *PACKAGES, check=False).stdout, "", "dpkg --verify")
@@ -772,14 +896,33 @@ def upgrade():
     expect(os.path.exists("/etc/brenvik/entitlements.d/50-bvhelperctl.plist"), "entitlements stay")
 
 
+def upgrade_from_a_version_without_workers():
+    """With a client that stays connected: it is served on, and the workers' sockets are there afterwards."""
+    run("dpkg", "-P", "brenvik-mobile-helper")
+    expect(not os.path.exists("/run/brenvik"), "/run/brenvik is left behind")
+    # The other packages are those of the new version, and say that they do not go with it.
+    run("dpkg", "--force-depends", "--force-breaks", "-i", "/packages/earlier.deb")
+    for path in WORKERS.values():
+        expect(not os.path.exists(path), f"not yet there: {path}")
+    with Library().connected(PATH):
+        process = property_of(SERVICE, "MainPID")
+        pathlib.Path("/proc/sys/net/ipv4/ping_group_range").write_text("0 0")  # as it left it
+        run("dpkg", "-i", *(each for each in glob.glob("/packages/*_*.deb") if "/brenvik-mobile-helper_" in each))
+        workers_listen()
+        expect_equal(property_of(SERVICE, "MainPID"), process, "a helper at work is left alone")
+        expect_equal(bvhelperctl("voicemail", "token").stdout, "a-token\n", "the helper that was there finds the new worker")
+    expect_equal(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").read_text().split(), ["0", "2147483647"], "ping sockets")
+
+
 def remove():
     run("dpkg", "-r", "brenvik-mobile-helper")
-    expect(not os.path.exists(PATH), "nobody listens")
+    for path in (PATH, *WORKERS.values()):
+        expect(not os.path.exists(path), f"nobody listens at {path}")
     expect(not os.path.exists("/usr/libexec/brenvik"), "the programs are gone")
     running = []
     for each in glob.glob("/proc/[0-9]*/comm"):
         with contextlib.suppress(FileNotFoundError, ProcessLookupError):  # a process that has ended since it was listed
-            if pathlib.Path(each).read_text() == "BrenvikMobileHe\n":
+            if pathlib.Path(each).read_text() in ("BrenvikMobileHe\n", "brenvik-network\n", "brenvik-store-w\n"):
                 running.append(each)
     expect_equal(running, [], "none is left running")
     expect_equal(bvhelperctl("ping", check=False).returncode, 5, "no helper")
@@ -804,8 +947,12 @@ def main():
     steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, works_in_its_sandbox,
              stores_no_preference_where_it_would_be_lost, works_for_the_whole_phone,
              asks_the_network, beats_over_the_cellular_link, held_in_its_sandbox,
-             other_accounts_are_told_apart, the_handbook_is_whole, a_telephony_daemon_without_rights_lives_with_it, journal_explains, leaves_when_idle_and_comes_back,
-             a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade, remove, purge]
+             a_helper_that_was_taken_over_is_held, a_network_worker_that_was_taken_over_is_held,
+             a_store_worker_that_was_taken_over_is_held, only_root_reaches_a_worker,
+             other_accounts_are_told_apart, the_handbook_is_whole, a_telephony_daemon_without_rights_lives_with_it,
+             journal_explains, leaves_when_idle_and_comes_back,
+             a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade,
+             upgrade_from_a_version_without_workers, remove, purge]
     for step in steps:
         began = time.monotonic()
         try:

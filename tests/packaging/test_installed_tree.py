@@ -74,6 +74,11 @@ class InstalledTree(unittest.TestCase):
                         r"lib/systemd/system/brenvik-mobile-helper\.socket",
                         r"lib/systemd/system/brenvik-mobile-helper\.service",
                         r"lib/systemd/system/brenvik-mobile-helper-restore\.service",
+                        r"libexec/brenvik/brenvik-network-worker", r"libexec/brenvik/brenvik-store-worker",
+                        r"lib/systemd/system/brenvik-network-worker\.socket",
+                        r"lib/systemd/system/brenvik-network-worker\.service",
+                        r"lib/systemd/system/brenvik-store-worker\.socket",
+                        r"lib/systemd/system/brenvik-store-worker\.service",
                         r"lib/systemd/catalog/brenvik-mobile-helper\.catalog", r"lib/sysusers\.d/brenvik-mobile-helper\.conf",
                         r"lib/tmpfiles\.d/brenvik-mobile-helper\.conf", r"lib/sysctl\.d/10-brenvik-mobile-helper\.conf",
                         r"share/bash-completion/completions/bvhelperctl", r"share/zsh/vendor-completions/_bvhelperctl",
@@ -115,10 +120,13 @@ class InstalledTree(unittest.TestCase):
     def test_nothing_of_the_tests_is_installed(self):
         self.assertEqual([each for each in self.files if re.search(r"test|fake|geocoder|fuzz|command-pages", each, re.I)], [])
 
-    def test_the_unit_starts_the_installed_program(self):
-        unit = self.one(r"lib/systemd/system/brenvik-mobile-helper\.service").read_text()
-        program = re.search(r"^ExecStart=(\S+)$", unit, flags=re.M)[1]
-        self.assertTrue((self.root / program[1:]).is_file(), program)
+    def test_the_units_start_the_installed_programs(self):
+        for name in ("brenvik-mobile-helper", "brenvik-network-worker", "brenvik-store-worker"):
+            unit = self.one(rf"lib/systemd/system/{name}\.service").read_text()
+            program = re.search(r"^ExecStart=(\S+)$", unit, flags=re.M)[1]
+            self.assertTrue((self.root / program[1:]).is_file(), program)
+            for folder in re.findall(r"^RootDirectory=(\S+)$", unit, flags=re.M):
+                self.assertTrue((self.root / folder[1:]).is_dir(), folder)
 
     def test_every_function_of_the_library_leads_to_its_page(self):
         if not self.pages:
