@@ -187,17 +187,35 @@ class Switches(ToolTest):
         self.addCleanup(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").write_text, "1 0")
         self.assertNotIn(note, self.json("heartbeat", "on")["notes"])
 
-    def test_a_bus_without_a_radio_manager_is_told_of(self):
+    def start(self, *command):
+        """A process of the test's, once it has printed its first line."""
+        process = subprocess.Popen(command, stdout=subprocess.PIPE)
+        self.addCleanup(process.stdout.close)
+        self.addCleanup(process.wait)
+        self.addCleanup(process.kill)
+        self.assertNotEqual(process.stdout.readline(), b"", command)
+        return process
+
+    def start_bus(self):
         pathlib.Path("/run/dbus").mkdir(exist_ok=True)
         self.addCleanup(shutil.rmtree, "/run/dbus")
-        bus = subprocess.Popen(["dbus-daemon", "--session", "--nofork", "--nosyslog", "--print-address=1",
-                                "--address=unix:path=/run/dbus/system_bus_socket"], stdout=subprocess.PIPE)
-        with bus.stdout:
-            self.addCleanup(bus.wait)
-            self.addCleanup(bus.kill)
-            bus.stdout.readline()
-            self.assertEqual(self.json("radio-logs", "on")["notes"], ["ModemManager is not running: no radio manager was told"])
-            self.assertNotIn("notes", self.json("radio-logs", "off"))
+        self.start("dbus-daemon", "--session", "--nofork", "--nosyslog", "--print-address=1",
+                   "--address=unix:path=/run/dbus/system_bus_socket")
+
+    def test_a_bus_without_a_radio_manager_is_told_of(self):
+        self.start_bus()
+        self.assertEqual(self.json("radio-logs", "on")["notes"], ["ModemManager is not running: no radio manager was told"])
+        self.assertNotIn("notes", self.json("radio-logs", "off"))
+
+    def test_a_radio_manager_without_a_modem_is_told_of(self):
+        self.start_bus()
+        for modems, notes in ((0, ["ModemManager knows no modem"]), (1, None), (2, None)):
+            manager = self.start(sys.executable, str(pathlib.Path(__file__).with_name("modem_manager.py")), str(modems))
+            self.assertEqual(self.json("radio-logs", "on").get("notes"), notes, modems)
+            # Of the helper, and of bvhelperctl.
+            self.assertEqual({manager.stdout.readline() for _ in range(2)}, {b"SetLogging\n", b"GetManagedObjects\n"})
+            manager.kill()
+            manager.wait()
 
     def test_a_silent_bus_does_not_keep_the_user_waiting(self):
         pathlib.Path("/run/dbus").mkdir(exist_ok=True)
