@@ -77,7 +77,7 @@ TEST(NotifySocketTest, AManagerThatReadsNothingIsNotWaitedFor) {
 
 TEST(NotifySocketTest, WithoutANameNobodyListens) {
   for (const std::string& name : {std::string(), std::string("/"), std::string("relative"),
-                                 std::string("vsock:2:9"), "/" + std::string(108, 'x')}) {
+                                  std::string("vsock:2:9"), "/" + std::string(108, 'x')}) {
     ::setenv("NOTIFY_SOCKET", name.c_str(), 1);
     NotifySocket socket;
     EXPECT_FALSE(socket.listens()) << name;
