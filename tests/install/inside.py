@@ -609,6 +609,23 @@ def journal_explains():
     expect("NOT Allowing path /etc/passwd" in asked, f"who asked for /etc/passwd is not told\n{asked[-2000:]}")
 
 
+def tells_what_keeps_it():
+    status = "/run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper.status"
+    wait_for(lambda: property_of(SERVICE, "ActiveState") == "inactive", "idle exit")
+    expect(not os.path.exists(status), "the status socket goes with the helper")
+    told = json.loads(bvhelperctl("--json", "status").stdout)
+    expect_equal((told["running"], told["socket"]["state"]), (False, "listening"))
+    expect_equal(property_of(SERVICE, "ActiveState"), "inactive", "asking starts nothing")
+    bvhelperctl("ping")
+    wait_for(lambda: os.path.exists(status), "the status socket")
+    facts = os.stat(status)
+    expect_equal((facts.st_uid, facts.st_gid, facts.st_mode & 0o7777), (0, grp.getgrnam("brenvik").gr_gid, 0o660))
+    told = json.loads(bvhelperctl("--json", "status").stdout)
+    expect_equal(told["pid"], int(property_of(SERVICE, "MainPID")))
+    expect_equal((told["version"], told["restartPending"]), (told["installed"], False))
+    wait_for(lambda: property_of(SERVICE, "StatusText") == "Idle, leaves soon", "the line of systemctl status")
+
+
 def leaves_when_idle_and_comes_back():
     bvhelperctl("ping")
     left = time.monotonic()
@@ -788,7 +805,8 @@ def main():
     steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, works_in_its_sandbox,
              stores_no_preference_where_it_would_be_lost, works_for_the_whole_phone,
              asks_the_network, beats_over_the_cellular_link, held_in_its_sandbox,
-             other_accounts_are_told_apart, a_telephony_daemon_without_rights_lives_with_it, journal_explains, leaves_when_idle_and_comes_back,
+             other_accounts_are_told_apart, a_telephony_daemon_without_rights_lives_with_it, journal_explains,
+             tells_what_keeps_it, leaves_when_idle_and_comes_back,
              a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade, remove, purge]
     for step in steps:
         began = time.monotonic()
