@@ -8,8 +8,11 @@
 #include <algorithm>
 #include <chrono>
 #include <csignal>
+#include <functional>
 #include <memory>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "helper/carrier/CarrierOperations.h"
 #include "helper/carrier/FileSystemManager.h"
@@ -165,8 +168,11 @@ class Areas {
 // come after the first reply, for which somebody waits.
 class Telling {
  public:
-  Telling(SystemPortSpace& ports, RunLoop& loop, WorkQueues& queues)
-      : ports_(ports), loop_(loop), queues_(queues) {}
+  // Processes that work for this one, and whether each runs at this moment; main loop only.
+  using Workers = std::function<std::vector<StatusReport::Worker>()>;
+
+  Telling(SystemPortSpace& ports, RunLoop& loop, WorkQueues& queues, Workers workers = {})
+      : ports_(ports), loop_(loop), queues_(queues), workers_(std::move(workers)) {}
 
   // While a server serves.
   void begin(ServerContext& server) {
@@ -175,7 +181,8 @@ class Telling {
                                                                    .heartbeat = CellularHeartbeat::shared(),
                                                                    .location = GeoRequestState::shared(),
                                                                    .version = kVersion,
-                                                                   .socket = serviceSocket_});
+                                                                   .socket = serviceSocket_,
+                                                                   .workers = workers_});
     // The loop looks at its descriptors first: a client that has started this process gets its reply before
     // this.
     queues_.main().post([this] {
@@ -198,6 +205,7 @@ class Telling {
   SystemPortSpace& ports_;
   RunLoop& loop_;
   WorkQueues& queues_;
+  const Workers workers_;
   std::unique_ptr<HelperStatus> status_;
   std::unique_ptr<StatusSocket> socket_;
   NotifySocket serviceManager_;
