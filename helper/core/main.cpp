@@ -10,6 +10,7 @@
 #include <csignal>
 #include <functional>
 #include <memory>
+#include <new>
 #include <string>
 #include <utility>
 #include <vector>
@@ -174,8 +175,8 @@ class Telling {
   Telling(SystemPortSpace& ports, RunLoop& loop, WorkQueues& queues, Workers workers = {})
       : ports_(ports), loop_(loop), queues_(queues), workers_(std::move(workers)) {}
 
-  // While a server serves.
-  void begin(ServerContext& server) {
+  // While a server serves. Without memory for it the helper serves all the same, and tells nothing.
+  void begin(ServerContext& server) try {
     status_ = std::make_unique<HelperStatus>(HelperStatus::Sources{.server = server,
                                                                    .lasd = *LASDUpdater::shared(),
                                                                    .heartbeat = CellularHeartbeat::shared(),
@@ -191,6 +192,8 @@ class Telling {
                                    [this] { return writeStatus(status_->report()); });
     });
     line_.changed();
+  } catch (const std::bad_alloc&) {
+    end();
   }
   void end() noexcept {
     socket_.reset();
