@@ -11,7 +11,7 @@
 namespace brenvik {
 
 int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests,
-              const std::function<void()>& endWork) {
+              const std::function<void()>& endWork, const std::function<void(ServerContext&)>& beginWork) {
   std::shared_ptr<HostedBasebandServer> hosted;
   if (baseband.canHost()) {
     hosted = baseband.create(nullptr);
@@ -29,6 +29,7 @@ int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const R
     }
   }
   if (server != nullptr) {
+    if (beginWork) beginWork(*server);
     RunServer(*server);
     endWork();
     DestroyServer(server);

@@ -14,9 +14,11 @@ namespace brenvik {
 // when the service could not be set up (which is logged). Main thread.
 //
 // `endWork` runs when serving is over and the server still stands: it ends the work of other threads, which
-// gives its busy tokens back to that server.
+// gives its busy tokens back to that server. `beginWork`, where there is one, runs with the server before it
+// serves.
 int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests,
-              const std::function<void()>& endWork);
+              const std::function<void()>& endWork,
+              const std::function<void(ServerContext&)>& beginWork = {});
 
 // Runs the process's work and returns its exit status; an exception that comes out of it is logged as the
 // failure to start that it is, and becomes 1. The log sink must outlive this call.

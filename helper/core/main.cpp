@@ -8,15 +8,21 @@
 #include <algorithm>
 #include <chrono>
 #include <csignal>
+#include <functional>
 #include <memory>
+#include <new>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "helper/carrier/CarrierOperations.h"
 #include "helper/carrier/FileSystemManager.h"
 #include "helper/carrier/PathPolicy.h"
 #include "helper/core/EntryPoint.h"
 #include "helper/core/HelperRoutines.h"
+#include "helper/core/HelperStatus.h"
 #include "helper/core/RequestsOnFirstUse.h"
+#include "helper/core/StatusLine.h"
 #include "helper/entitlement/EntitlementCheck.h"
 #include "helper/location/GeoRequestState.h"
 #include "helper/mobile/MobileUser.h"
@@ -26,6 +32,7 @@
 #include "platform/baseband/linux/LoadedBasebandLibrary.h"
 #include "platform/files/linux/LinuxFileManager.h"
 #include "platform/files/linux/ZipArchiveCopier.h"
+#include "platform/ipc/linux/StatusSocket.h"
 #include "platform/ipc/linux/SystemBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/labeler/linux/CatalogueLabeler.h"
@@ -40,6 +47,7 @@
 #include "platform/radio/linux/ModemManagerLogs.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/security/linux/EntitlementFiles.h"
+#include "platform/servicemanager/linux/NotifySocket.h"
 #include "platform/stores/RemoteContacts.h"
 #include "platform/stores/RemoteVoicemailStore.h"
 #include "platform/stores/linux/PreparedFolder.h"
@@ -52,6 +60,11 @@ namespace {
 
 // A client takes two descriptors, and its process one: 4,000 clients of as many processes, and as much again.
 constexpr rlim_t kDescriptors = 16384;
+
+// What programs look for in the file of this one, in the form of what(1), to learn which version is
+// installed.
+[[gnu::used]] constexpr char kWhat[] = "@(#)BrenvikMobileHelper " BRENVIK_VERSION;
+constexpr const char* kVersion = kWhat + sizeof "@(#)BrenvikMobileHelper";
 
 void prepareProcess() noexcept {
   rlimit descriptors{};
@@ -162,6 +175,57 @@ class Areas {
   const RequestTable requests_{routines_};
 };
 
+// What the process tells about itself: at its status socket, and to the service manager in one line. Both
+// come after the first reply, for which somebody waits.
+class Telling {
+ public:
+  // Processes that work for this one, and whether each runs at this moment; main loop only.
+  using Workers = std::function<std::vector<StatusReport::Worker>()>;
+
+  Telling(SystemPortSpace& ports, RunLoop& loop, WorkQueues& queues, Workers workers = {})
+      : ports_(ports), loop_(loop), queues_(queues), workers_(std::move(workers)) {}
+
+  // While a server serves. Without memory for it the helper serves all the same, and tells nothing.
+  void begin(ServerContext& server) try {
+    status_ = std::make_unique<HelperStatus>(HelperStatus::Sources{.server = server,
+                                                                   .lasd = *LASDUpdater::shared(),
+                                                                   .heartbeat = CellularHeartbeat::shared(),
+                                                                   .location = GeoRequestState::shared(),
+                                                                   .version = kVersion,
+                                                                   .socket = serviceSocket_,
+                                                                   .workers = workers_});
+    // The loop looks at its descriptors first: a client that has started this process gets its reply before
+    // this.
+    queues_.main().post([this] {
+      if (status_ == nullptr) return;
+      socket_ = StatusSocket::make(ports_, loop_, serviceSocket_,
+                                   [this] { return writeStatus(status_->report()); });
+    });
+    line_.changed();
+  } catch (const std::bad_alloc&) {
+    end();
+  }
+  void end() noexcept {
+    socket_.reset();
+    status_.reset();
+  }
+  // Any thread.
+  void changed() noexcept { line_.changed(); }
+
+ private:
+  const std::string serviceSocket_ = std::string(BRENVIK_BOOTSTRAP_DIRECTORY "/") + kServiceName;
+
+  SystemPortSpace& ports_;
+  RunLoop& loop_;
+  WorkQueues& queues_;
+  const Workers workers_;
+  std::unique_ptr<HelperStatus> status_;
+  std::unique_ptr<StatusSocket> socket_;
+  NotifySocket serviceManager_;
+  StatusLine line_{queues_, serviceManager_,
+                   [this] { return status_ != nullptr ? status_->line() : std::string("Leaves"); }};
+};
+
 int run() {
   prepareProcess();
   const auto loop = SystemRunLoop::make();
@@ -184,6 +248,7 @@ int run() {
   const auto describeCaller = [&entitlements](const AuditToken& caller) {
     return entitlements.describe(caller);
   };
+  Telling telling(ports, *loop, queues);
   const ServerPlatform platform{.ports = ports,
                                 .bootstrap = bootstrap,
                                 .sources = sources,
@@ -193,8 +258,14 @@ int run() {
                                       return entitlements.HasEntitlement(entitlement, caller);
                                     },
                                 .idlePeriod = std::chrono::milliseconds(BRENVIK_IDLE_MILLISECONDS),
-                                .describeCaller = describeCaller};
-  return runHelper(baseband, platform, requests, [&requests] { requests.shutDown(); });
+                                .describeCaller = describeCaller,
+                                .onChange = [&telling] { telling.changed(); }};
+  const auto endWork = [&telling, &requests] {
+    telling.end();
+    requests.shutDown();
+  };
+  return runHelper(baseband, platform, requests, endWork,
+                   [&telling](ServerContext& server) { telling.begin(server); });
 }
 
 }  // namespace
@@ -202,8 +273,9 @@ int run() {
 
 int main() {
   // First of all: nothing that comes later is to find anything there. These are the service manager's way to
-  // hand over the listening socket, and go when that has been taken.
-  brenvik::clearEnvironmentExcept({"LISTEN_PID", "LISTEN_FDS", "LISTEN_FDNAMES"});
+  // hand over the listening socket and to be told, and go when they have been taken.
+  brenvik::clearEnvironmentExcept(
+      {"LISTEN_PID", "LISTEN_FDS", "LISTEN_FDNAMES", brenvik::NotifySocket::kVariable});
   brenvik::SystemLog log("BrenvikMobileHelper");
   brenvik::setLogSink(&log);
   const int status = brenvik::runReportingFailure(brenvik::run);

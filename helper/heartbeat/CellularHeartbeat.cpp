@@ -16,6 +16,7 @@
 #include <utility>
 
 #include "helper/heartbeat/EchoMessage.h"
+#include "interface/status/Status.h"
 #include "platform/base/Utf8.h"
 #include "platform/log/Log.h"
 
@@ -72,7 +73,8 @@ void CellularHeartbeat::start(ServerContext& server) {
     timer_ = queue_->makeTimer(0s, kInterval, kLeeway, [this] { (void)ping(); });  // told nobody, by design
     (void)ping();                                                                  // likewise
     if (timer_ != nullptr) {
-      busyToken_ = AcquireBusyToken(server);
+      isOn_ = true;
+      busyToken_ = AcquireBusyToken(server, StatusReport::kHeartbeat);
       isArmed = timer_->activate();
     }
   } catch (const std::bad_alloc&) {  // as below
@@ -84,6 +86,7 @@ void CellularHeartbeat::start(ServerContext& server) {
 
 void CellularHeartbeat::stop(ServerContext& server) {
   timer_.reset();
+  isOn_ = false;
   // Never started: token 0 goes to the server that asked, and is refused there.
   (void)ReleaseBusyToken(server_ != nullptr ? *server_ : server, std::exchange(busyToken_, 0));
 }
@@ -119,6 +122,7 @@ int CellularHeartbeat::ping() noexcept {
   const EchoMessage request = makeEchoRequest(identifier, now);
   const EchoTransfer sent = socket->sendTo(destination, request);
   if (sent.count != static_cast<std::ptrdiff_t>(request.size())) return errorOr(sent.error, 1);
+  sent_.add(request.size());
 
   std::array<std::byte, kLargestDatagram> buffer;
   std::optional<std::chrono::microseconds> begin;
@@ -130,7 +134,10 @@ int CellularHeartbeat::ping() noexcept {
     if (!begin) begin = time;
     if (received.count >= 0) {
       const auto datagram = std::span(buffer).first(static_cast<std::size_t>(received.count));
-      if (isEchoReply(datagram, socket->deliversIpHeader(), identifier)) return 0;
+      if (isEchoReply(datagram, socket->deliversIpHeader(), identifier)) {
+        received_.add(request.size());  // a reply says what the request said
+        return 0;
+      }
     } else if (received.error != EAGAIN) {
       return errorOr(received.error, 1);
     }

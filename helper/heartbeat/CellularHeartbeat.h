@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <string>
@@ -47,6 +48,15 @@ class CellularHeartbeat {
   // only.
   void shutDown() noexcept;
 
+  // Whether it is on, and what went out and came back since the process began. Any thread.
+  struct Traffic {
+    std::uint64_t packets = 0;
+    std::uint64_t bytes = 0;  // of ICMP messages
+  };
+  bool isOn() const noexcept { return isOn_.load(std::memory_order_relaxed); }
+  Traffic sent() const noexcept { return sent_.read(); }
+  Traffic received() const noexcept { return received_.read(); }
+
   // One probe, up to two seconds: sends a request and waits for its reply. 0, or what went wrong as an errno
   // number. On the heartbeat's queue, or with none running.
   int ping() noexcept;
@@ -54,6 +64,25 @@ class CellularHeartbeat {
  private:
   void start(ServerContext& server);
   void stop(ServerContext& server);
+
+  // One writer; readers may see a packet whose bytes are not counted yet.
+  class Counter {
+   public:
+    void add(std::size_t bytes) noexcept {
+      packets_.fetch_add(1, std::memory_order_relaxed);
+      bytes_.fetch_add(bytes, std::memory_order_relaxed);
+    }
+    Traffic read() const noexcept {
+      return {packets_.load(std::memory_order_relaxed), bytes_.load(std::memory_order_relaxed)};
+    }
+
+   private:
+    std::atomic<std::uint64_t> packets_{0};
+    std::atomic<std::uint64_t> bytes_{0};
+  };
+  std::atomic<bool> isOn_{false};
+  Counter sent_;
+  Counter received_;
 
   std::unique_ptr<Parts> parts_;
   // Below: on the queue only.

@@ -84,6 +84,34 @@ TEST_F(CellularHeartbeatTest, AProbeSendsOneRequestWithOurIdentifierAndEndsAtIts
   EXPECT_TRUE(network.namesAsked.empty()) << "an address needs no look-up";
 }
 
+TEST_F(CellularHeartbeatTest, WhatGoesOutAndComesBackIsCounted) {
+  const std::size_t size = makeEchoRequest(0, timeval{}).size();
+  replyArrives(30ms, echoReply(ourIdentifier()));
+  EXPECT_EQ(heartbeat.ping(), 0);
+  EXPECT_EQ(heartbeat.ping(), ETIMEDOUT);
+  EXPECT_EQ(heartbeat.sent().packets, 2U);
+  EXPECT_EQ(heartbeat.sent().bytes, 2 * size);
+  EXPECT_EQ(heartbeat.received().packets, 1U);
+  EXPECT_EQ(heartbeat.received().bytes, size);
+  network.sendError = ENETUNREACH;
+  EXPECT_EQ(heartbeat.ping(), ENETUNREACH);
+  EXPECT_EQ(heartbeat.sent().packets, 2U);
+}
+
+TEST_F(CellularHeartbeatTest, WhetherItIsOnIsTold) {
+  EXPECT_FALSE(heartbeat.isOn());
+  heartbeat.setHeartbeat(server, true);
+  runQueue();
+  EXPECT_TRUE(heartbeat.isOn());
+  heartbeat.setHeartbeat(server, false);
+  runQueue();
+  EXPECT_FALSE(heartbeat.isOn());
+  queues.serial.at(0)->timers = ManualWorkQueue::Timers::cannotBeArmed;
+  heartbeat.setHeartbeat(server, true);
+  runQueue();
+  EXPECT_FALSE(heartbeat.isOn());
+}
+
 TEST_F(CellularHeartbeatTest, TheSocketIsSetUpInOrderAndBoundToTheCellularInterface) {
   network.cellularIndex = 7;
   replyArrives(0ms, echoReply(ourIdentifier()));

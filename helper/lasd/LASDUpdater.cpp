@@ -10,6 +10,7 @@
 
 #include "helper/lasd/DatabaseTypes.h"
 #include "helper/lasd/VersionText.h"
+#include "interface/status/Status.h"
 #include "platform/log/Log.h"
 #include "platform/plist/PropertyListCodec.h"
 
@@ -35,7 +36,8 @@ std::string_view textOf(const PropertyList& string) { return string.asString().v
 class HeldToken {
  public:
   HeldToken(ServerContext& server, std::uint32_t token) noexcept : server_(server), token_(token) {}
-  explicit HeldToken(ServerContext& server) : HeldToken(server, AcquireBusyToken(server)) {}
+  explicit HeldToken(ServerContext& server)
+      : HeldToken(server, AcquireBusyToken(server, StatusReport::kDatabaseCheck)) {}
   HeldToken(const HeldToken&) = delete;
   HeldToken& operator=(const HeldToken&) = delete;
   ~HeldToken() { (void)ReleaseBusyToken(server_, token_); }  // one bit, as it was given
@@ -78,7 +80,7 @@ void LASDUpdater::shutDown() noexcept { queue_.reset(); }
 
 void LASDUpdater::checkForUpdate(ServerContext& server, std::uint32_t mask) {
   logUnified(LogLevel::info, "Trying to see if update available for mask %x", mask);
-  const std::uint32_t token = AcquireBusyToken(server);
+  const std::uint32_t token = AcquireBusyToken(server, StatusReport::kDatabaseCheck);
   const std::weak_ptr<LASDUpdater> weak = weak_from_this();
   auto self = weak.lock();
   if (self == nullptr) std::terminate();
@@ -93,6 +95,7 @@ void LASDUpdater::checkForUpdate(ServerContext& server, std::uint32_t mask) {
         logUnified(LogLevel::error, "Update check given up: out of memory");
         self->tell(NotificationKind::updateFailed, 0);
       }
+      self->noteEnd();
     });
   } catch (...) {
     (void)ReleaseBusyToken(server, token);  // one bit, as it was given: no check will do it
@@ -102,6 +105,7 @@ void LASDUpdater::checkForUpdate(ServerContext& server, std::uint32_t mask) {
 
 void LASDUpdater::check(ServerContext& server, std::uint32_t mask) {
   outOfMemory_ = 0;
+  note(mask, LastCheck::Outcome::checking);
   loadVersions(kVersionsDomain, VersionSource::preferences, mask);
   const std::int64_t result = loadVersions(parts_->manifestUrl, VersionSource::manifest, mask);
   if (result == kNotFetched) return tell(NotificationKind::updateFailed, 0);
@@ -117,6 +121,31 @@ void LASDUpdater::check(ServerContext& server, std::uint32_t mask) {
       const HeldToken own(server);
       updateDatabase(type);
     }
+  }
+}
+
+std::vector<LASDUpdater::LastCheck> LASDUpdater::lastChecks() const {
+  std::vector<LastCheck> checks;
+  const std::lock_guard lock(checksMutex_);
+  for (const LastCheck& each : lastChecks_) {
+    if (each.type != 0) checks.push_back(each);
+  }
+  return checks;
+}
+
+void LASDUpdater::note(std::uint32_t mask, LastCheck::Outcome outcome) noexcept {
+  const std::lock_guard lock(checksMutex_);
+  for (std::size_t i = 0; i < lastChecks_.size(); ++i) {
+    const std::int32_t type = kDatabaseTypesInOrder[i];
+    if ((mask & static_cast<std::uint32_t>(type)) != 0) lastChecks_[i] = {type, outcome, parts_->now()};
+  }
+}
+
+void LASDUpdater::noteEnd() noexcept {
+  const std::lock_guard lock(checksMutex_);
+  for (LastCheck& each : lastChecks_) {
+    if (each.outcome == LastCheck::Outcome::checking)
+      each = {each.type, LastCheck::Outcome::failed, parts_->now()};
   }
 }
 
@@ -166,9 +195,12 @@ std::int64_t LASDUpdater::compareWithManifest(const PropertyList& manifest, std:
   std::int64_t result = 0;
   for (auto& [type, record] : versions_) {
     try {
-      if ((static_cast<std::uint32_t>(type) & mask) == 0 || isUpToDate(manifest, type)) continue;
+      if ((static_cast<std::uint32_t>(type) & mask) == 0) continue;
       const PropertyList serverEntry = onlyDictionary(manifest.find(nameOfDatabaseType(type)));
-      if (!serverEntry) continue;
+      if (isUpToDate(manifest, type) || !serverEntry) {
+        note(static_cast<std::uint32_t>(type), LastCheck::Outcome::noUpdateRequired);
+        continue;
+      }
       record = ownCopy(serverEntry);
       result |= type;
     } catch (const std::bad_alloc&) {
@@ -226,6 +258,7 @@ void LASDUpdater::updateDatabase(std::int32_t type) {
   } catch (const std::bad_alloc&) {
     giveUp(type);
   }
+  note(static_cast<std::uint32_t>(type), ok ? LastCheck::Outcome::updated : LastCheck::Outcome::failed);
   tell(ok ? NotificationKind::updateAvailable : NotificationKind::updateFailed, type);
 }
 

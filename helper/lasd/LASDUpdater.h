@@ -2,16 +2,22 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <array>
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <string>
+#include <vector>
 
 #include "Helper/Shared/Server/BusyTokens.h"
 #include "helper/lasd/DatabaseInstaller.h"
+#include "helper/lasd/DatabaseTypes.h"
 #include "helper/lasd/HttpFetcher.h"
 #include "helper/lasd/Notifications.h"
+#include "platform/base/Clock.h"
 #include "platform/messageport/MessagePort.h"
 #include "platform/plist/PropertyList.h"
 #include "platform/preferences/PreferencesStore.h"
@@ -40,6 +46,7 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
     std::string manifestUrl = kManifestUrl;
     std::string directory = kDatabaseDirectory;
     std::function<DiskSpace(int file)> diskSpace = diskSpaceOf;
+    std::function<std::chrono::nanoseconds()> now = timeSinceBoot;
   };
   enum class VersionSource { preferences, manifest };
   // loadVersions() could not fetch the manifest; as a mask, no set of types is that large.
@@ -62,6 +69,16 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
   // its way out.
   void checkForUpdate(ServerContext& server, std::uint32_t mask);
 
+  // How the last check of a type went, or that it is under way; by the clock of Parts.
+  struct LastCheck {
+    enum class Outcome : std::uint8_t { checking, updated, noUpdateRequired, failed };
+    std::int32_t type = 0;
+    Outcome outcome = Outcome::checking;
+    std::chrono::nanoseconds when{0};
+  };
+  // Of the types that were checked in this process. Any thread. Throws std::bad_alloc.
+  std::vector<LastCheck> lastChecks() const;
+
   // Ends the queue after the check that runs, which may wait for the HTTP client. Main loop only.
   void shutDown() noexcept;
 
@@ -83,12 +100,17 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
   void check(ServerContext& server, std::uint32_t mask);
   // Drops what cannot be sent.
   void tell(NotificationKind kind, std::int32_t type) noexcept;
+  // Of the types in the mask. A type that stays at `checking` has failed when the check ends.
+  void note(std::uint32_t mask, LastCheck::Outcome outcome) noexcept;
+  void noteEnd() noexcept;
 
   std::unique_ptr<Parts> parts_;
   // By type, the record found here or, once it needs an update, the server's; none when there is no record.
   std::map<std::int32_t, PropertyList> versions_;  // on the queue only
   // The types of the present check for which memory did not suffice.
   std::int64_t outOfMemory_ = 0;  // on the queue only
+  mutable std::mutex checksMutex_;
+  std::array<LastCheck, kDatabaseTypesInOrder.size()> lastChecks_;  // with checksMutex_; type 0: none yet
   // Last, so that it ends first: its tasks use everything above.
   std::shared_ptr<WorkQueue> queue_;
 };

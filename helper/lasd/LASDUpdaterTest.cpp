@@ -154,6 +154,52 @@ TEST_F(LASDUpdaterTest, ASecondCheckFindsNothingToDo) {
   EXPECT_TRUE(logged(info("gsm version 1.0 matches server version")));
 }
 
+TEST_F(LASDUpdaterTest, HowEachTypesLastCheckWentIsKept) {
+  using Outcome = LASDUpdater::LastCheck::Outcome;
+  const auto outcomes = [this] {
+    std::vector<std::pair<std::int32_t, Outcome>> result;
+    for (const auto& each : updater->lastChecks()) result.emplace_back(each.type, each.outcome);
+    return result;
+  };
+  using Outcomes = std::vector<std::pair<std::int32_t, Outcome>>;
+  EXPECT_TRUE(outcomes().empty());
+  // One that is new, one that is not, one that cannot be had, one without a URL, one that the server does not
+  // know.
+  serveGzip(urlOf("gsm"), "gsm 2");
+  web.fail(urlOf("umts"), WebErrorKind::cellularNotAllowed);
+  serveManifest({{"gsm", record("2", urlOf("gsm"))},
+                 {"umts", record("2", urlOf("umts"))},
+                 {"cdma", record("1", urlOf("cdma"))},
+                 {"lte", versionOnly("1")}});
+  setLocal("cdma", versionOnly("1"));
+  check(kAll);
+  EXPECT_EQ(outcomes(), (Outcomes{{gsm, Outcome::updated},
+                                  {umts, Outcome::failed},
+                                  {cdma, Outcome::noUpdateRequired},
+                                  {lte, Outcome::failed},
+                                  {scdma, Outcome::noUpdateRequired}}));
+}
+
+TEST_F(LASDUpdaterTest, ACheckThatIsUnderWayIsToldAndOneWithoutAManifestHasFailed) {
+  using Outcome = LASDUpdater::LastCheck::Outcome;
+  web.fail(kManifest, WebErrorKind::cellularNotAllowed);
+  updater->checkForUpdate(server, lte);
+  EXPECT_TRUE(updater->lastChecks().empty()) << "it has not begun";
+  web.holdAnswers();
+  std::thread checking([&] { queues.updater->runReady(); });
+  while (web.seen().empty()) std::this_thread::yield();
+  ASSERT_EQ(updater->lastChecks().size(), 1U);
+  EXPECT_EQ(updater->lastChecks()[0].type, lte);
+  EXPECT_EQ(updater->lastChecks()[0].outcome, Outcome::checking);
+  web.releaseAnswers();
+  checking.join();
+  ASSERT_EQ(updater->lastChecks().size(), 1U);
+  EXPECT_EQ(updater->lastChecks()[0].outcome, Outcome::failed);
+  web.answer(kManifest, 200, "no manifest");
+  check(lte);
+  EXPECT_EQ(updater->lastChecks()[0].outcome, Outcome::failed);
+}
+
 TEST_F(LASDUpdaterTest, TheWholeOfACheckIsLoggedInOrder) {
   serveManifest({{"gsm", record("2", urlOf("gsm"))}, {"umts", record("1", urlOf("umts"))}});
   setLocal("umts", versionOnly("1"));

@@ -34,6 +34,7 @@ void GeoRequests::handleMapItems(CivicInfo& info, const std::optional<MapItems>&
            "_RequestCivicInfoFromLatitudeLongitude wasn't waiting for response from GEO");
     return;
   }
+  state_.noteEnding(error ? GeoRequestState::Ending::failed : GeoRequestState::Ending::answered);
   takeFirstMapItem(info, items, error);
   if (info.countryCode.empty()) info.countryCode = currentCountryCode();
   sendCivicInfoToBrenvik(info);

@@ -3,9 +3,13 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
+#include <cstdint>
 #include <memory>
 #include <mutex>
+#include <optional>
 
+#include "platform/base/Clock.h"
 #include "platform/runloop/WorkQueue.h"
 
 namespace brenvik {
@@ -26,7 +30,25 @@ class GeoRequestState {
     awaitingGeoResponse_.store(awaiting, std::memory_order_relaxed);
   }
 
+  // How the last request ended, and when by timeSinceBoot(): by the geo service's answer, by its error, or
+  // without either in time. Nothing of what was asked or answered.
+  enum class Ending : std::uint8_t { answered, failed, timedOut };
+  struct LastEnding {
+    Ending ending = Ending::answered;
+    std::chrono::nanoseconds when{0};
+  };
+  void noteEnding(Ending ending, std::chrono::nanoseconds now = timeSinceBoot()) noexcept {
+    const std::lock_guard lock(endingMutex_);
+    lastEnding_ = {ending, now};
+  }
+  std::optional<LastEnding> lastEnding() const noexcept {
+    const std::lock_guard lock(endingMutex_);
+    return lastEnding_;
+  }
+
  private:
+  mutable std::mutex endingMutex_;
+  std::optional<LastEnding> lastEnding_;  // with endingMutex_
   std::once_flag queueMade_;
   std::shared_ptr<WorkQueue> queue_;
   // Relaxed, and deliberately no exchange: an event reads it once and clears it once, and nothing is ordered

@@ -38,7 +38,9 @@ void GeoRequests::awaitGeoResponse(void (GeoRequests::*fallback)()) {
   queues_.main().postAfter(kGeoResponseTimeOut, [self = shared_from_this(), fallback] {
     // Tasks of the main queue and close() share a thread: looking is enough.
     if (self->closed_.load()) return;
-    if (self->takeAwaitedResponse()) (self.get()->*fallback)();
+    if (!self->takeAwaitedResponse()) return;
+    self->state_.noteEnding(GeoRequestState::Ending::timedOut);
+    (self.get()->*fallback)();
   });
 }
 

@@ -111,6 +111,30 @@ TEST_F(LocationRoutinesTest, TheProcessHasOneSharedState) {
   EXPECT_FALSE(GeoRequestState::shared().isAwaitingGeoResponse());
 }
 
+TEST_F(LocationRoutinesTest, HowTheLastRequestEndedIsKeptAndLateAnswersDoNotCount) {
+  using Ending = GeoRequestState::Ending;
+  EXPECT_FALSE(state.lastEnding());
+  askCivicInfo();
+  settle();
+  EXPECT_FALSE(state.lastEnding());
+  geo.reverseGeocodes.at(0).answer(MapItems{});
+  settle();
+  ASSERT_TRUE(state.lastEnding());
+  EXPECT_EQ(state.lastEnding()->ending, Ending::answered);
+  askWanIp();
+  settle();
+  geo.geoIps.at(0).fail("none");
+  settle();
+  EXPECT_EQ(state.lastEnding()->ending, Ending::failed);
+  askWanIp();
+  settle();
+  pass(5s);
+  EXPECT_EQ(state.lastEnding()->ending, Ending::timedOut);
+  geo.geoIps.at(1).answer("198.51.100.7");
+  settle();
+  EXPECT_EQ(state.lastEnding()->ending, Ending::timedOut);
+}
+
 TEST_F(LocationRoutinesTest, RoutinesAnswerBeforeTheGeoServiceIsAsked) {
   EXPECT_EQ(askCivicInfo(), kern::success);
   EXPECT_EQ(askWanIp(), kern::success);

@@ -26,6 +26,7 @@ void GeoRequests::handleGeoIpResult(const std::optional<GeoIpResult>& result,
     logUnified(LogLevel::standard, "_RequestWanIPFromLocation wasn't waiting for response from GEO");
     return;
   }
+  state_.noteEnding(error ? GeoRequestState::Ending::failed : GeoRequestState::Ending::answered);
   if (error) {
     logUnified(LogLevel::error, "_RequestWanIPFromLocation error: (%s)", error->description.c_str());
     // Empty, but pushed: the telephony daemon learns that there is no address.

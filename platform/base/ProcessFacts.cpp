@@ -3,6 +3,8 @@
 #include "platform/base/ProcessFacts.h"
 
 #include <fcntl.h>
+#include <limits.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <array>
@@ -55,6 +57,30 @@ std::optional<ProcessFacts> processFacts(pid_t pid) noexcept {
 std::optional<std::uint32_t> processStartTime(pid_t pid) noexcept {
   const auto facts = processFacts(pid);
   return facts ? std::optional(facts->startTime) : std::nullopt;
+}
+
+ProgramFacts programFacts() { return programFactsOf("/proc/self/exe"); }
+
+ProgramFacts programFactsOf(const char* link) {
+  std::array<char, PATH_MAX> text;
+  const ssize_t size = ::readlink(link, text.data(), text.size());
+  if (size <= 0) return {};
+  ProgramFacts facts;
+  facts.path.assign(text.data(), static_cast<std::size_t>(size));
+  struct stat running {};
+  struct stat standing {};
+  // Through the link the kernel leads to the file itself, whatever has become of its name.
+  if (::stat(link, &running) != 0) return facts;
+  const auto differs = [&] {
+    return ::stat(facts.path.c_str(), &standing) != 0 || standing.st_dev != running.st_dev ||
+           standing.st_ino != running.st_ino;
+  };
+  if (!differs()) return facts;
+  facts.isReplaced = true;
+  // So proc(5) marks a name that is gone; a name may end like that, too, but then it is still there.
+  constexpr std::string_view kMark = " (deleted)";
+  if (facts.path.ends_with(kMark)) facts.path.resize(facts.path.size() - kMark.size());
+  return facts;
 }
 
 }  // namespace brenvik

@@ -6,6 +6,7 @@
 
 #include <cstdint>
 #include <optional>
+#include <string>
 #include <string_view>
 
 namespace brenvik {
@@ -24,5 +25,14 @@ std::optional<ProcessFacts> parseProcessStat(std::string_view text) noexcept;
 // Nothing when there is no such process. Any thread; allocates nothing.
 std::optional<ProcessFacts> processFacts(pid_t pid) noexcept;
 std::optional<std::uint32_t> processStartTime(pid_t pid) noexcept;
+
+// Of which file this process runs. Any thread.
+struct ProgramFacts {
+  std::string path;         // where it stood when it was started; empty: not known
+  bool isReplaced = false;  // another file stands there now, or none
+};
+ProgramFacts programFacts();
+// The same for a link like /proc/self/exe.
+ProgramFacts programFactsOf(const char* link);
 
 }  // namespace brenvik

@@ -3,7 +3,14 @@
 #include "platform/base/ProcessFacts.h"
 
 #include <gtest/gtest.h>
+#include <sys/wait.h>
 #include <unistd.h>
+
+#include <csignal>
+#include <cstdlib>
+#include <filesystem>
+#include <string>
+#include <thread>
 
 #include <string>
 
@@ -55,6 +62,63 @@ TEST(ProcessFactsTest, TellsOfThisProcess) {
 TEST(ProcessFactsTest, TellsNothingOfNobody) {
   EXPECT_FALSE(processFacts(0x7FFFFFFF));
   EXPECT_FALSE(processStartTime(-1));
+}
+
+// A program of our own that runs until it is told to end.
+class ProgramFactsTest : public testing::Test {
+ protected:
+  ProgramFactsTest() {
+    std::string name = (std::filesystem::temp_directory_path() / "program-XXXXXX").string();
+    folder_ = ::mkdtemp(name.data());
+    program = folder_ / "sleep";
+    std::filesystem::copy_file("/bin/sleep", program);
+    process_ = ::fork();
+    if (process_ == 0) {
+      ::execl(program.c_str(), "sleep", "60", nullptr);
+      ::_exit(127);
+    }
+    link = "/proc/" + std::to_string(process_) + "/exe";
+    while (std::filesystem::read_symlink(link) != program) std::this_thread::yield();
+  }
+  ~ProgramFactsTest() override {
+    ::kill(process_, SIGKILL);
+    ::waitpid(process_, nullptr, 0);
+    std::filesystem::remove_all(folder_);
+  }
+  std::filesystem::path program;
+  std::string link;
+
+ private:
+  std::filesystem::path folder_;
+  pid_t process_ = -1;
+};
+
+TEST_F(ProgramFactsTest, AProgramThatStandsWhereItStoodIsNotReplaced) {
+  const ProgramFacts facts = programFactsOf(link.c_str());
+  EXPECT_EQ(facts.path, program.string());
+  EXPECT_FALSE(facts.isReplaced);
+}
+
+TEST_F(ProgramFactsTest, AnotherFileInItsPlaceIsNoticedAndThePathStays) {
+  std::filesystem::copy_file("/bin/sleep", program.string() + ".new");
+  std::filesystem::rename(program.string() + ".new", program);
+  const ProgramFacts facts = programFactsOf(link.c_str());
+  EXPECT_EQ(facts.path, program.string());
+  EXPECT_TRUE(facts.isReplaced);
+}
+
+TEST_F(ProgramFactsTest, AProgramThatWasRemovedIsReplacedToo) {
+  std::filesystem::remove(program);
+  const ProgramFacts facts = programFactsOf(link.c_str());
+  EXPECT_EQ(facts.path, program.string());
+  EXPECT_TRUE(facts.isReplaced);
+}
+
+TEST(ProgramFactsOfNobodyTest, NothingIsKnown) {
+  const ProgramFacts facts = programFactsOf("/proc/0/exe");
+  EXPECT_EQ(facts.path, "");
+  EXPECT_FALSE(facts.isReplaced);
+  EXPECT_EQ(programFacts().path, std::filesystem::read_symlink("/proc/self/exe").string());
 }
 
 }  // namespace

@@ -24,7 +24,8 @@ from unittest import mock
 import network
 import test_lasd
 import wire
-from harness import ALLOW, BUILD, DAEMON, ENTITLEMENTS, LOG_ERR, LOG_NOTICE, Daemon, HelperTest, entitle, eventually, main
+from harness import (ALLOW, BUILD, DAEMON, DEFAULT, ENTITLEMENTS, LOG_ERR, LOG_NOTICE, Daemon, HelperTest, entitle,
+                     eventually, main)
 
 sys.path.append(str(pathlib.Path(__file__).parents[2] / "tools" / "tests"))
 import schema  # noqa: E402, of another folder
@@ -187,17 +188,35 @@ class Switches(ToolTest):
         self.addCleanup(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").write_text, "1 0")
         self.assertNotIn(note, self.json("heartbeat", "on")["notes"])
 
-    def test_a_bus_without_a_radio_manager_is_told_of(self):
+    def start(self, *command):
+        """A process of the test's, once it has printed its first line."""
+        process = subprocess.Popen(command, stdout=subprocess.PIPE)
+        self.addCleanup(process.stdout.close)
+        self.addCleanup(process.wait)
+        self.addCleanup(process.kill)
+        self.assertNotEqual(process.stdout.readline(), b"", command)
+        return process
+
+    def start_bus(self):
         pathlib.Path("/run/dbus").mkdir(exist_ok=True)
         self.addCleanup(shutil.rmtree, "/run/dbus")
-        bus = subprocess.Popen(["dbus-daemon", "--session", "--nofork", "--nosyslog", "--print-address=1",
-                                "--address=unix:path=/run/dbus/system_bus_socket"], stdout=subprocess.PIPE)
-        with bus.stdout:
-            self.addCleanup(bus.wait)
-            self.addCleanup(bus.kill)
-            bus.stdout.readline()
-            self.assertEqual(self.json("radio-logs", "on")["notes"], ["ModemManager is not running: no radio manager was told"])
-            self.assertNotIn("notes", self.json("radio-logs", "off"))
+        self.start("dbus-daemon", "--session", "--nofork", "--nosyslog", "--print-address=1",
+                   "--address=unix:path=/run/dbus/system_bus_socket")
+
+    def test_a_bus_without_a_radio_manager_is_told_of(self):
+        self.start_bus()
+        self.assertEqual(self.json("radio-logs", "on")["notes"], ["ModemManager is not running: no radio manager was told"])
+        self.assertNotIn("notes", self.json("radio-logs", "off"))
+
+    def test_a_radio_manager_without_a_modem_is_told_of(self):
+        self.start_bus()
+        for modems, notes in ((0, ["ModemManager knows no modem"]), (1, None), (2, None)):
+            manager = self.start(sys.executable, str(pathlib.Path(__file__).with_name("modem_manager.py")), str(modems))
+            self.assertEqual(self.json("radio-logs", "on").get("notes"), notes, modems)
+            # Of the helper, and of bvhelperctl.
+            self.assertEqual({manager.stdout.readline() for _ in range(2)}, {b"SetLogging\n", b"GetManagedObjects\n"})
+            manager.kill()
+            manager.wait()
 
     def test_a_silent_bus_does_not_keep_the_user_waiting(self):
         pathlib.Path("/run/dbus").mkdir(exist_ok=True)
@@ -237,6 +256,44 @@ class Contacts(ToolTest):
             contacts.commit()
             self.expect("remapped contacts from old to new\n", "contacts", "remap", "old", "new")
             self.assertEqual(contacts.execute("SELECT * FROM contact_channels").fetchall(), [(1, "new")])
+
+
+class Privacy(ToolTest):
+    """What belongs to a person stands in those lines whose text has it, and nowhere else."""
+
+    FIXED = re.compile(r"remapChannelIdentifier \S+ -> \S+|_RequestCivicInfoFromLatitudeLongitude (country code|state|city|postal "
+                       r"code): .*|_RequestWanIPFromLocation WAN IP: .*")
+    PRIVATE = ("4915112345678", "49301234567", "Berlin", "52.5", "13.4", "a-secret-token", "secret-value")
+
+    def test_numbers_places_and_tokens_are_in_no_other_line_or_field(self):
+        store = Contacts.STORE
+        store.parent.mkdir(parents=True, exist_ok=True)
+        self.addCleanup(shutil.rmtree, store.parent)
+        with contextlib.closing(sqlite3.connect(store)) as contacts:
+            contacts.execute("CREATE TABLE contact_channels(contact_id INTEGER NOT NULL, channel_identifier TEXT NOT NULL)")
+            contacts.execute("INSERT INTO contact_channels VALUES(1, '+4915112345678')")
+            contacts.commit()
+        self.assertEqual(run("contacts", "remap", "+4915112345678", "+49301234567").returncode, 0)
+        with contextlib.closing(sqlite3.connect(store)) as contacts:  # a failure, which has a description
+            contacts.execute("DROP TABLE contact_channels")
+            contacts.commit()
+        self.assertEqual(run("contacts", "remap", "+49301234567", "+4915112345678").returncode, 1)
+        self.assertEqual(run("location", "civic", "--wait", "52.52", "13.40").returncode, 0)
+        self.assertEqual(run("location", "civic", "52.52", "13.40").returncode, 0)  # nobody takes the push
+        run("voicemail", "set-token", "-", given="a-secret-token")
+        run("voicemail", "token")
+        self.assertEqual(run("prefs", "set", "com.example.private", "key", "-", given="secret-value").returncode, 0)
+        self.addCleanup(pathlib.Path("/root/Library/Preferences/com.example.private.plist").unlink)
+        self.addCleanup(run, "voicemail", "reset")
+        self.logs.wait_for("bsd", LOG_NOTICE, "_RequestCivicInfoFromLatitudeLongitude city: Berlin")
+        self.logs.wait_for("unified", DEFAULT, "remapChannelIdentifier +4915112345678 -> +49301234567")
+        told = [text for _, _, text in self.logs.lines] + run("status").stdout.splitlines() + [
+            f"{key}={value}" for entry in self.logs.entries for key, value in entry.items() if key != "MESSAGE"]
+        self.assertGreater(len(told), 50, told)
+        for text in told:
+            if not self.FIXED.fullmatch(text.rstrip("\n")):
+                for private in self.PRIVATE:
+                    self.assertNotIn(private, text)
 
 
 class Carrier(ToolTest):

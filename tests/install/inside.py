@@ -747,6 +747,23 @@ def journal_explains():
     expect("NOT Allowing path /etc/passwd" in asked, f"who asked for /etc/passwd is not told\n{asked[-2000:]}")
 
 
+def tells_what_keeps_it():
+    status = "/run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper.status"
+    wait_for(lambda: property_of(SERVICE, "ActiveState") == "inactive", "idle exit")
+    expect(not os.path.exists(status), "the status socket goes with the helper")
+    told = json.loads(bvhelperctl("--json", "status").stdout)
+    expect_equal((told["running"], told["socket"]["state"]), (False, "listening"))
+    expect_equal(property_of(SERVICE, "ActiveState"), "inactive", "asking starts nothing")
+    bvhelperctl("ping")
+    wait_for(lambda: os.path.exists(status), "the status socket")
+    facts = os.stat(status)
+    expect_equal((facts.st_uid, facts.st_gid, facts.st_mode & 0o7777), (0, grp.getgrnam("brenvik").gr_gid, 0o660))
+    told = json.loads(bvhelperctl("--json", "status").stdout)
+    expect_equal(told["pid"], int(property_of(SERVICE, "MainPID")))
+    expect_equal((told["version"], told["restartPending"]), (told["installed"], False))
+    wait_for(lambda: property_of(SERVICE, "StatusText") == "Idle, leaves soon", "the line of systemctl status")
+
+
 def leaves_when_idle_and_comes_back():
     bvhelperctl("ping")
     left = time.monotonic()
@@ -950,7 +967,7 @@ def main():
              a_helper_that_was_taken_over_is_held, a_network_worker_that_was_taken_over_is_held,
              a_store_worker_that_was_taken_over_is_held, only_root_reaches_a_worker,
              other_accounts_are_told_apart, the_handbook_is_whole, a_telephony_daemon_without_rights_lives_with_it,
-             journal_explains, leaves_when_idle_and_comes_back,
+             journal_explains, tells_what_keeps_it, leaves_when_idle_and_comes_back,
              a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade,
              upgrade_from_a_version_without_workers, remove, purge]
     for step in steps:

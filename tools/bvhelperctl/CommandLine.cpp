@@ -2,7 +2,6 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "tools/bvhelperctl/CommandLine.h"
 
-#include <pwd.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -15,6 +14,7 @@
 #include <optional>
 #include <string>
 
+#include "tools/bvhelperctl/Advice.h"
 #include "tools/bvhelperctl/CommandTable.h"
 #include "tools/bvhelperctl/Completion.h"
 #include "tools/support/EventStream.h"
@@ -53,11 +53,6 @@ std::string pathOfThisProgram() {
   return length > 0 ? printable({path.data(), static_cast<std::size_t>(length)}) : std::string(kProgram);
 }
 
-std::string accountOfThisProcess() {
-  const passwd* account = ::getpwuid(::geteuid());
-  return account == nullptr ? "user " + std::to_string(::geteuid()) : printable(account->pw_name);
-}
-
 // Whether others than root could change this program: it gets no entitlement then.
 bool isChangeableByOthers() {
   struct stat facts {};
@@ -84,16 +79,6 @@ std::string entitlementAdvice() {
          "    <key>Entitlements</key>\n"
          "    <dict><key>com.norvale.Teravox.BrenvikHelper.allow</key><true/></dict>\n"
          "  </dict></plist>";
-}
-
-// What to do when the account may not even connect.
-std::string groupAdvice() {
-  return "Only root and members of the group \"" BRENVIK_SERVICE_GROUP
-         "\" may. Let an administrator add the account, and log in anew:\n"
-         "  usermod -aG " BRENVIK_SERVICE_GROUP " " +
-         accountOfThisProcess() +
-         "\n"
-         "It then needs the entitlement, too: this command tells how.";
 }
 
 bool isTransportFailure(std::int32_t code) { return code >= BVMH_ERROR_FIRST && code <= BVMH_ERROR_LAST; }
@@ -124,7 +109,7 @@ ExitStatus reportCode(const Settings& settings, bvmh_client* client, const Outco
       if (error == EACCES) {
         return fail(settings, status,
                     "refused: this account may not connect to " + printable(socketOf(settings)),
-                    groupAdvice(), fields);
+                    groupAdvice() + "\nIt then needs the entitlement, too: this command tells how.", fields);
       }
       return fail(settings, status, "refused: " + text, entitlementAdvice(), fields);
     case BVMH_NO_ACCESS:

@@ -12,6 +12,7 @@
 #include "platform/plist/PropertyListCodec.h"
 #include "tools/bvhelperctl/AccessCommand.h"
 #include "tools/bvhelperctl/Call.h"
+#include "tools/bvhelperctl/StatusCommand.h"
 #include "tools/bvhelperctl/Switches.h"
 #include "tools/bvhelperctl/Waiting.h"
 #include "tools/support/Base64.h"
@@ -754,6 +755,15 @@ std::span<const Command> makeTable() {
         {"--user", "account it runs under, default yours", ValueKind::text, 0, {}, false, "USER"},
         {"--unit", "unit of the service manager it runs in", ValueKind::text, 0, {}, false, "UNIT"}},
        [](bvmh_client*, const Values& values) { return explainAccess(values); },
+       true},
+
+      {"",
+       "status",
+       "show whether the helper runs, what keeps it, and what it did last",
+       {},
+       {},
+       {},
+       [](bvmh_client*, const Values& values) { return showStatus(values); },
        true},
 
       {"",

@@ -6,17 +6,15 @@
 #include <net/if.h>
 #include <systemd/sd-bus.h>
 
-#include <algorithm>
 #include <charconv>
 #include <chrono>
 #include <cstdint>
-#include <filesystem>
 #include <memory>
 #include <string>
-#include <system_error>
 #include <vector>
 
 #include "tools/bvhelperctl/Call.h"
+#include "tools/bvhelperctl/HelperProcess.h"
 #include "tools/support/EventStream.h"
 
 namespace brenvik::tools {
@@ -25,34 +23,6 @@ namespace {
 // ---- the heartbeat --------------------------------------------------------------------------------------
 
 constexpr const char* kCellularInterface = "pdp_ip0";
-// As the kernel shows it: cut to 15 characters.
-constexpr const char* kHelperProcessName = "BrenvikMobileHe";
-
-// The content of a file of the kernel's, empty when it cannot be read. Not by streams: with them the program
-// carries all of the library's locales, and each start of any command is slower by a fifth.
-std::string factsIn(const std::filesystem::path& path) {
-  try {
-    return contentOf(path.string());
-  } catch (const UsageError&) {
-    return "";
-  }
-}
-
-// The words of the first line that begins with `name`.
-std::vector<std::string> wordsAfter(const std::string& text, const std::string& name) {
-  std::vector<std::string> words;
-  std::size_t at = name.empty() ? 0 : text.find('\n' + name);
-  if (at == std::string::npos) return words;
-  at += name.empty() ? 0 : name.size() + 1;
-  const std::string line = text.substr(at, text.find('\n', at) - at);
-  for (std::size_t start = 0; (start = line.find_first_not_of(" \t", start)) != std::string::npos;) {
-    const std::size_t end = std::min(line.find_first_of(" \t", start), line.size());
-    words.push_back(line.substr(start, end - start));
-    start = end;
-  }
-  return words;
-}
-
 // Whether a process with these facts (of /proc/PID/status) may send an echo: by its groups or by CAP_NET_RAW.
 bool maySendEchoes(const std::string& status, std::uint32_t leastGroup, std::uint32_t greatestGroup) {
   constexpr unsigned kCapNetRaw = 13;
@@ -78,13 +48,8 @@ bool isEchoForbidden() {
   const auto least = numberIn<std::uint32_t>(range[0]).value_or(1);
   const auto greatest = numberIn<std::uint32_t>(range[1]).value_or(0);
   bool isForbidden = false;
-  std::error_code error;
-  for (auto entry = std::filesystem::directory_iterator("/proc", error);
-       !error && entry != std::filesystem::directory_iterator(); entry.increment(error)) {
-    if (factsIn(entry->path() / "comm") != std::string(kHelperProcessName) + '\n') continue;
-    const std::string status = factsIn(entry->path() / "status");
-    if (status.empty()) continue;
-    if (maySendEchoes(status, least, greatest)) return false;
+  for (const HelperProcess& each : helperProcesses()) {
+    if (maySendEchoes(each.status, least, greatest)) return false;
     isForbidden = true;
   }
   return isForbidden;

@@ -19,6 +19,7 @@ import socket
 import struct
 import subprocess
 import tempfile
+import threading
 import unittest
 
 import fake_helper
@@ -520,6 +521,110 @@ class Unusable(ToolTest):
     def test_a_socket_path_that_is_none(self):
         for self.socket in (self.folder / ("x" * 120), ""):
             _, err = self.run_tool("ping", status=2)
+            self.assertEqual(err, "bvhelperctl: --socket: the path is empty or too long for a socket\n")
+
+
+class Status(ToolTest):
+    """What a helper tells at its status socket, played by the test."""
+
+    LEAST = {"version": "0.1.0", "process": "77", "running-ms": "5000", "clients": "0", "busy-tokens": "0"}
+
+    def answer(self, *texts):
+        """Each connection gets the next text, or is closed without a word; after the last one nobody listens."""
+        listening = socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET)
+        path = f"{self.socket}.status"
+        with contextlib.suppress(FileNotFoundError):
+            os.unlink(path)
+        listening.bind(path)
+        listening.listen(8)
+
+        def serve():
+            with listening:
+                for text in texts:
+                    connection, _ = listening.accept()
+                    with connection:
+                        if text is None:
+                            connection.recv(1)  # until the other side gives up
+                        elif text:
+                            connection.send(text if isinstance(text, bytes) else text.encode())
+        thread = threading.Thread(target=serve, daemon=True)
+        thread.start()
+        self.addCleanup(thread.join, 20)
+
+    def text(self, *more, **facts):
+        lines = [f"{key}={value}" for key, value in {**self.LEAST, **facts}.items()]
+        return "\n".join(["brenvik-status=1", *lines, *more]) + "\n"
+
+    def test_all_that_a_helper_tells_is_shown(self):
+        told = self.text("executable=/none", "socket=/run/service", "busy=database-check 2", "busy=heartbeat 1",
+                         "heartbeat=yes", "heartbeat-sent=1 40", "heartbeat-received=0 0", "database=gsm updated 3000",
+                         "database=umts checking 100", "location-answer=timed-out 7300000", "worker=network running",
+                         "worker=stores stopped", "a-newer-key=x", **{"busy-tokens": 3, "clients": 2})
+        self.answer(told, told)
+        out, err = self.run_tool("status")
+        lines = out.splitlines()
+        self.assertRegex(lines.pop(0), r"^helper        running since \d{4}-\d\d-\d\dT\d\d:\d\d:\d\dZ \(5 s\), process 77$")
+        self.assertEqual(lines, [
+            "version       0.1.0", "socket        /run/service, which is missing",
+            "held by       2 clients, a database check, the heartbeat", "busy tokens   3",
+            "heartbeat     on, 1 packet (40 bytes) sent, 0 packets (0 bytes) received",
+            "databases     gsm: updated, 3 s ago", "              umts: checking, since 0 s",
+            "location      last request timed out, 2 h ago", "workers       network: running",
+            "              stores: not running"])
+        self.assertEqual(err, "")
+        answer = self.json("status")
+        self.assertEqual((answer["version"], answer["installed"], answer["restartPending"]), ("0.1.0", None, False))
+        self.assertEqual(answer["heldBy"], ["2 clients", "a database check", "the heartbeat"])
+        self.assertEqual(answer["heartbeat"], {"on": True, "sent": {"packets": 1, "bytes": 40},
+                                               "received": {"packets": 0, "bytes": 0}})
+        self.assertEqual([(each["type"], each["outcome"], each["age"]) for each in answer["databases"]],
+                         [("gsm", "updated", 3.0), ("umts", "checking", 0.1)])
+        self.assertEqual(answer["locationAnswer"], {"outcome": "timed-out", "age": 7300.0})
+        self.assertEqual(answer["workers"], [{"name": "network", "running": True}, {"name": "stores", "running": False}])
+
+    def test_an_idle_helper_says_when_it_leaves(self):
+        self.answer(self.text("leaves-in-ms=6001"), self.text("leaves-in-ms=6001", "kept-by-baseband=yes"))
+        self.assertIn("held by       nothing: idle, leaves in 7 s\n", self.run_tool("status")[0])
+        self.assertIn("held by       the hosted baseband server\n", self.run_tool("status")[0])
+
+    def test_nothing_that_is_told_steers_the_terminal(self):
+        hostile = self.text(version="1\x1b[31m", executable="/\x1b]0;x\x07")
+        self.answer(hostile, hostile, hostile.encode().replace(b"31m", b"\xff"))
+        self.assertNotIn("\x1b", "".join(self.run_tool("status")))
+        self.json("status")
+        self.json("status")
+
+    def test_what_is_no_status_is_not_understood(self):
+        for text in ("hello\n", "brenvik-status=2\n", self.text().replace("version", "revision"), self.text() + "x" * 20000,
+                     self.text(clients="many")):
+            self.answer(text)
+            answer = self.json("status", status=7)
+            self.assertIn("is no status", answer["error"])
+
+    def test_a_connection_that_is_closed_without_a_word_is_tried_again(self):
+        self.answer("", "", self.text())
+        self.assertEqual(self.json("status")["pid"], 77)
+
+    def test_a_helper_that_does_not_answer_is_given_up(self):
+        self.answer(None)
+        out, err = self.run_tool("--timeout", "0.3", "status", status=6)
+        self.assertEqual(out, "")
+        self.assertIn("bvhelperctl: no status in 0.3 s\n", err)
+
+    def test_nobody_there_is_an_answer(self):
+        for make in (lambda: None, self.socket.touch, lambda: (self.socket.unlink(), self.stale(self.socket)),
+                     lambda: self.stale(f"{self.socket}.status")):
+            make()
+            self.assertIs(self.json("status")["running"], False)
+
+    @staticmethod
+    def stale(path):
+        with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as sock:
+            sock.bind(str(path))
+
+    def test_a_path_that_is_none(self):
+        for self.socket in (self.folder / ("x" * 120), ""):
+            _, err = self.run_tool("status", status=2)
             self.assertEqual(err, "bvhelperctl: --socket: the path is empty or too long for a socket\n")
 
 

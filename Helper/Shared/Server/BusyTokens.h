@@ -9,8 +9,9 @@ namespace brenvik {
 class ServerContext;
 
 // Takes a busy token: a mask with one bit. While any token is held the process does not leave for being idle.
-// With all 32 out, the first is given again (1). Any thread.
-std::uint32_t AcquireBusyToken(ServerContext& server);
+// With all 32 out, the first is given again (1). `reason`: for whoever asks what keeps the process; static
+// storage. Any thread.
+std::uint32_t AcquireBusyToken(ServerContext& server, const char* reason = "unnamed-work");
 
 // Gives a token back: 1 when it was well formed (exactly one bit set), else 0 and nothing changes. Giving
 // back the last one while no client is checked in starts the idle countdown. Any thread.

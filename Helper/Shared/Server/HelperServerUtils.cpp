@@ -27,12 +27,24 @@ void idleTimerTick(ServerContext& server) {
     // Cancelled by another thread while this tick was on its way.
     if (server.idleTimer == nullptr) return;
   }
-  if (!server.idleCheck || !server.idleCheck()) StopServer(server);
+  if (!server.idleCheck || !server.idleCheck()) {
+    StopServer(server);
+    return;
+  }
+  const Lock lock(server.lock);
+  server.isKeptByIdleCheck = true;
+}
+
+// No lock held.
+void tellOfChange(const ServerContext& server) {
+  if (server.platform.onChange) server.platform.onChange();
 }
 
 // Lock held; given up for a moment when the timer cannot be made.
 void armIdleTimer(ServerContext& server, Lock& lock) {
   if (server.idleTimer != nullptr) return;
+  server.idleSince = server.platform.now();
+  server.isKeptByIdleCheck = false;
   RunLoop& loop = server.runLoop != nullptr ? *server.runLoop : server.platform.loop;
   const std::chrono::nanoseconds period = server.platform.idlePeriod;
   try {
@@ -168,14 +180,17 @@ void DestroyServer(ServerContext* server) {
   delete server;
 }
 
-std::uint32_t AcquireBusyToken(ServerContext& server) {
-  const Lock lock(server.lock);
+std::uint32_t AcquireBusyToken(ServerContext& server, const char* reason) {
+  Lock lock(server.lock);
   // The run of set bits from bit 0 is what counts: a hole above a clear bit 0 is not looked for. With all 32
   // set the shift wraps, and bit 0 is given once more.
   const auto run = static_cast<unsigned>(std::countr_one(server.busyMask));
   const std::uint32_t token = std::uint32_t{1} << (run % 32U);
   server.busyMask |= token;
+  server.busyReasons[run % 32U] = reason;
   cancelIdleTimer(server);
+  lock.unlock();
+  tellOfChange(server);
   return token;
 }
 
@@ -184,6 +199,8 @@ std::uint32_t ReleaseBusyToken(ServerContext& server, std::uint32_t token) {
   Lock lock(server.lock);
   server.busyMask &= ~token;
   if (server.busyMask == 0 && server.clientWatches.empty()) armIdleTimer(server, lock);
+  lock.unlock();
+  tellOfChange(server);
   return 1;
 }
 
@@ -247,6 +264,8 @@ KernelReturn BVMobileHelperCheckIn(PortServerRegistry& registry, const ServerPla
     return kern::failure;
   }
   cancelIdleTimer(*server);
+  lock.unlock();
+  tellOfChange(*server);
   if (!deathWatch->isValid())
     return kern::failure;  // the callback, already on its way, tears the client down
   *clientPort = port;
@@ -263,6 +282,8 @@ void OnClientPortDied(DeathWatch& deathWatch, ServerContext* context, PortServer
     TearDownClient(*server, dead.deathWatch, dead.receivePort);
   }
   if (server->busyMask == 0 && server->clientWatches.empty()) armIdleTimer(*server, lock);
+  lock.unlock();
+  tellOfChange(*server);
 }
 
 }  // namespace brenvik

@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <array>
 #include <chrono>
 #include <cstdint>
 #include <functional>
@@ -12,6 +13,7 @@
 #include "Helper/Shared/Server/BusyTokens.h"
 #include "Helper/Shared/Server/PortServerRegistry.h"
 #include "interface/Messages.h"
+#include "platform/base/Clock.h"
 #include "platform/ipc/AuditToken.h"
 #include "platform/ipc/Ports.h"
 #include "platform/log/LogContext.h"
@@ -39,6 +41,11 @@ struct ServerPlatform {
   std::chrono::nanoseconds idlePeriod = std::chrono::seconds(10);
   // Who an admitted caller is, for the fields of the lines that its requests cause; null when not known.
   std::function<std::shared_ptr<const LogCaller>(const AuditToken& caller)> describeCaller = {};
+  // Called after a client has come or gone and a busy token was taken or given back, on the thread that did
+  // it and with no lock held.
+  std::function<void()> onChange = {};
+  // The clock of the idle period, for whoever asks how long is left of it.
+  std::function<std::chrono::nanoseconds()> now = timeSinceBoot;
 };
 
 class ServerContext;
@@ -101,6 +108,9 @@ class ServerContext {
   std::map<DeathWatch*, Client> clientWatches;
   std::map<PortName, std::shared_ptr<RoutineSource>> clientSources;
   std::uint32_t busyMask = 0;
+  std::array<const char*, 32> busyReasons{};  // of the bits that are set
+  std::chrono::nanoseconds idleSince{0};      // when the idle timer was armed
+  bool isKeptByIdleCheck = false;             // its last answer
   bool stopFlag = false;
 };
 

@@ -10,6 +10,7 @@
 
 #include "platform/geo/linux/GeocoderAnswer.h"
 #include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
 
 namespace brenvik {
 namespace {
@@ -112,13 +113,14 @@ void ReverseGeocoder::send(Coordinate coordinate, const Deliver& deliver,
       request->setTimeLimit(kGeocoderPatience);
       request->setLargestBody(kLargestGeocoderAnswer);
       request->setCallbackQueue(queue);
-      request->setCompletion(
-          [weak = weak_from_this(), coordinate, deliver](const std::shared_ptr<WebResponse>& response) {
-            const auto self = weak.lock();
-            if (self == nullptr) return;
-            const std::lock_guard lock(self->atWork_);
-            if (!self->closed_) self->takeResponse(coordinate, deliver, response);
-          });
+      request->setCompletion([weak = weak_from_this(), coordinate, deliver,
+                              context = LogScope::current()](const std::shared_ptr<WebResponse>& response) {
+        const LogScope scope(context);
+        const auto self = weak.lock();
+        if (self == nullptr) return;
+        const std::lock_guard lock(self->atWork_);
+        if (!self->closed_) self->takeResponse(coordinate, deliver, response);
+      });
       return request->send({});
     }
   } catch (const std::bad_alloc&) {

@@ -7,6 +7,7 @@
 #include <limits>
 
 #include "platform/geo/linux/GeocoderAnswer.h"
+#include "platform/log/LogContext.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
 #include "platform/web/fakes/ScriptedWebClient.h"
@@ -100,6 +101,19 @@ TEST_F(ReverseGeocoderTest, TheEdgesOfTheRangeAreCoordinates) {
     ask(offline, coordinate);
     EXPECT_TRUE(answers.back().items);
   }
+}
+
+TEST_F(ReverseGeocoderTest, ALineAboutTheServersAnswerSaysWhoHasAsked) {
+  web.answer(kOsloUrl, 500, "");
+  const auto online = geocoder(kServer);
+  {
+    const LogScope scope("BVMobileHelperRequestCountryCodeFromLocation", 7);
+    online->lookUp(
+        kOslo, [](std::optional<MapItems>, std::optional<GeoError>) {}, queue);
+  }
+  queue->runReady();
+  ASSERT_EQ(log.entries().size(), 1U);
+  EXPECT_EQ(log.fields()[0].at("BRENVIK_ROUTINE"), "BVMobileHelperRequestCountryCodeFromLocation");
 }
 
 TEST_F(ReverseGeocoderTest, TheServersAnswerIsTaken) {

@@ -38,6 +38,8 @@ class SystemPortSpace final : public PortSpace {
 
   // Shares a connected socket that only this process holds. Throws bad_alloc.
   SharedFd share(UniqueFd socket, Account account);
+  // Shares a socket that others may hold, too, or that others can put messages into. Throws bad_alloc.
+  SharedFd shareForeign(UniqueFd socket, Account account);
   ClosingLine& closing() noexcept { return *closing_; }
 
   // The descriptor behind a right, kept open by the result even when the name is freed meanwhile; null when
@@ -62,7 +64,6 @@ class SystemPortSpace final : public PortSpace {
 
   PortName unusedName() noexcept;
   Port* insert(PortName* name) noexcept;
-  SharedFd shareForeign(UniqueFd socket, Account account);
   std::weak_ptr<ClosingLine> weakLine() const noexcept { return closing_; }
   void eraseIfUnused(PortName name) noexcept;
 

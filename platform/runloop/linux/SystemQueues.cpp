@@ -91,7 +91,8 @@ class SystemQueue : public WorkQueue {
   std::unique_ptr<Timer> makeTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
                                    std::chrono::nanoseconds leeway, Task handler) override {
     start();
-    return std::make_unique<QueueTimer>(loop_, first, interval, leeway, std::move(handler));
+    return std::make_unique<QueueTimer>(loop_, first, interval, leeway,
+                                        inCurrentLogContext(std::move(handler)));
   }
   bool isCurrent() const noexcept override { return loop_->onLoopThread(); }
   std::unique_ptr<DescriptorSource> watchDescriptor(int fd, std::uint32_t events,

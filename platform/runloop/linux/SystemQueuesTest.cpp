@@ -368,6 +368,25 @@ TEST_F(SystemQueuesTest, LinesOfATaskCarryTheFieldsOfTheRequestThatPostedItAndOf
   EXPECT_EQ(log.fields(), (std::vector<std::map<std::string, std::string>>{fields, fields, {}}));
 }
 
+TEST_F(SystemQueuesTest, LinesOfARepeatingTimerCarryTheFieldsOfTheRequestThatMadeIt) {
+  RecordingLog log;
+  SystemQueues queues(*loop);
+  int ran = 0;
+  std::unique_ptr<WorkQueue::Timer> timer;
+  {
+    const LogScope scope("Routine", 7);
+    timer = queues.main().makeTimer(1ms, 1ms, 0ns, [&] {
+      logUnified(LogLevel::info, "again");
+      ++ran;
+    });
+  }
+  ASSERT_TRUE(timer->activate());
+  runUntil([&] { return ran >= 2; });
+  const std::map<std::string, std::string> fields{{"BRENVIK_ROUTINE", "Routine"}};
+  EXPECT_EQ(log.fields()[0], fields);
+  EXPECT_EQ(log.fields()[1], fields);
+}
+
 TEST_F(SystemQueuesTest, MainQueueRunsTasksInOrderOnTheLoop) {
   SystemQueues queues(*loop);
   std::string order;

@@ -1,0 +1,156 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "helper/core/HelperStatus.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include "platform/ipc/fakes/FakePorts.h"
+#include "platform/log/fakes/RecordingLog.h"
+#include "platform/runloop/fakes/ManualRunLoop.h"
+
+namespace brenvik {
+namespace {
+
+using namespace std::chrono_literals;
+
+class HelperStatusTest : public testing::Test {
+ protected:
+  ~HelperStatusTest() override { DestroyServer(server); }
+
+  void clientComes() {
+    PortName port = kNullPort;
+    ASSERT_EQ(
+        BVMobileHelperCheckIn(registry, platform, server->servicePort, ports.adoptSendRight(), &port, {}), 0);
+  }
+  void clientGoes() { sources.deathWatches.back()->tellDeath(); }
+
+  ManualClock clock;
+  ManualRunLoop loop{clock};
+  FakePortSpace ports;
+  FakeBootstrap bootstrap{ports};
+  FakePortSources sources;
+  PortServerRegistry registry;
+  ServerPlatform platform{.ports = ports,
+                          .bootstrap = bootstrap,
+                          .sources = sources,
+                          .loop = loop,
+                          .hasEntitlement = [](const char*, const AuditToken&) { return true; },
+                          .registry = registry,
+                          .now = [this] { return clock.now(); }};
+  NoRoutines routines;
+  RecordingLog log;
+  ServerContext* server = CreateServer(platform, kServiceName, routines);
+  std::shared_ptr<LASDUpdater> lasd = std::make_shared<LASDUpdater>();
+  CellularHeartbeat heartbeat;
+  GeoRequestState location;
+  std::vector<StatusReport::Worker> workers;
+  ProgramFacts program{"/usr/libexec/helper", true};
+  HelperStatus status{{.server = *server,
+                       .lasd = *lasd,
+                       .heartbeat = heartbeat,
+                       .location = location,
+                       .version = "1.2.3",
+                       .socket = "/run/service",
+                       .workers = [this] { return workers; },
+                       .program = [this] { return program; },
+                       .now = [this] { return clock.now(); }}};
+};
+
+TEST_F(HelperStatusTest, AHelperThatHasJustBegunWaitsForItsFirstClient) {
+  clock.advance(1500ms);
+  StatusReport wanted;
+  wanted.version = "1.2.3";
+  wanted.process = static_cast<std::uint64_t>(::getpid());
+  wanted.executable = "/usr/libexec/helper";
+  wanted.isReplaced = true;
+  wanted.socket = "/run/service";
+  wanted.running = 1500ms;
+  EXPECT_EQ(status.report(), wanted);
+  EXPECT_EQ(status.line(), "Waits for its first client");
+}
+
+TEST_F(HelperStatusTest, ClientsTokensAndTheCountdownAreTold) {
+  clientComes();
+  const auto check = AcquireBusyToken(*server, StatusReport::kDatabaseCheck);
+  const auto again = AcquireBusyToken(*server, StatusReport::kDatabaseCheck);
+  const auto beat = AcquireBusyToken(*server, StatusReport::kHeartbeat);
+  StatusReport told = status.report();
+  EXPECT_EQ(told.clients, 1U);
+  EXPECT_EQ(told.busyTokens, 3U);
+  EXPECT_EQ(told.busy, (std::vector<StatusReport::Busy>{{"database-check", 2}, {"heartbeat", 1}}));
+  EXPECT_FALSE(told.leavesIn);
+  EXPECT_EQ(status.line(),
+            "Kept by 1 client, a database check, a heartbeat that was switched on more than once");
+  for (const auto each : {check, again, beat}) EXPECT_EQ(ReleaseBusyToken(*server, each), 1U);
+  clientGoes();
+  clock.advance(3s);
+  told = status.report();
+  EXPECT_EQ(told.clients, 0U);
+  EXPECT_TRUE(told.busy.empty());
+  EXPECT_EQ(told.leavesIn, 7000ms);
+  EXPECT_EQ(status.line(), "Idle, leaves soon");
+}
+
+TEST_F(HelperStatusTest, AHostedServerThatIsBusyIsNamedAndTheCountdownBeginsAnew) {
+  SetIdleCheck(server, [] { return true; });
+  clientComes();
+  clientGoes();
+  EXPECT_FALSE(status.report().isKeptByBaseband);
+  clock.advance(10s);
+  StatusReport told = status.report();
+  EXPECT_TRUE(told.isKeptByBaseband);
+  EXPECT_EQ(told.leavesIn, 10000ms);
+  clientComes();
+  EXPECT_FALSE(status.report().isKeptByBaseband);
+}
+
+TEST_F(HelperStatusTest, HowLocationRequestsEndedIsToldWithoutAnyPlace) {
+  clock.advance(5s);
+  const std::pair<GeoRequestState::Ending, const char*> endings[] = {
+      {GeoRequestState::Ending::answered, "answered"},
+      {GeoRequestState::Ending::failed, "failed"},
+      {GeoRequestState::Ending::timedOut, "timed-out"}};
+  for (const auto& [ending, name] : endings) {
+    location.noteEnding(ending, clock.now());
+    clock.advance(2s);
+    EXPECT_EQ(status.report().locationAnswer, (StatusReport::Event{name, 2000ms}));
+  }
+}
+
+TEST_F(HelperStatusTest, WorkersAreToldAsTheyAre) {
+  workers = {{"network", true}, {"stores", false}};
+  EXPECT_EQ(status.report().workers, workers);
+}
+
+TEST_F(HelperStatusTest, EveryChangeIsToldWithNoLockHeld) {
+  DestroyServer(server);
+  int changes = 0;
+  ServerPlatform listening{.ports = ports,
+                           .bootstrap = bootstrap,
+                           .sources = sources,
+                           .loop = loop,
+                           .hasEntitlement = [](const char*, const AuditToken&) { return true; },
+                           .registry = registry,
+                           .onChange =
+                               [&] {
+                                 ++changes;
+                                 EXPECT_TRUE(server->lock.try_lock());
+                                 server->lock.unlock();
+                               }};
+  server = CreateServer(listening, kServiceName, routines);
+  PortName port = kNullPort;
+  ASSERT_EQ(
+      BVMobileHelperCheckIn(registry, listening, server->servicePort, ports.adoptSendRight(), &port, {}), 0);
+  EXPECT_EQ(changes, 1);
+  clientGoes();
+  EXPECT_EQ(changes, 2);
+  const auto token = AcquireBusyToken(*server);
+  EXPECT_EQ(changes, 3);
+  (void)ReleaseBusyToken(*server, token);
+  EXPECT_EQ(changes, 4);
+  DestroyServer(std::exchange(server, nullptr));
+}
+
+}  // namespace
+}  // namespace brenvik

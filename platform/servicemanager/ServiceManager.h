@@ -1,0 +1,20 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <string>
+
+namespace brenvik {
+
+// Whoever has started this process and shows it to people.
+class ServiceManager {
+ public:
+  virtual ~ServiceManager() = default;
+
+  // False: nobody listens, and showing is for nothing.
+  virtual bool listens() const noexcept = 0;
+  // Shows the line from now on. Does not wait; a line that cannot be sent is lost. Any thread.
+  virtual void show(const std::string& line) noexcept = 0;
+};
+
+}  // namespace brenvik
