@@ -728,10 +728,7 @@ class SocketDeathWatch final : public DeathWatch {
 }  // namespace
 
 SystemPortSources::SystemPortSources(SystemPortSpace& ports, SystemRegions& regions, Refusals refusals)
-    : ports_(ports),
-      regions_(regions),
-      refusals_(refusals),
-      incoming_(std::make_unique<IncomingMessage>(ports)) {}
+    : ports_(ports), regions_(regions), refusals_(refusals), incoming_(ports) {}
 
 SystemPortSources::~SystemPortSources() = default;
 
@@ -741,11 +738,11 @@ std::shared_ptr<RoutineSource> SystemPortSources::makeRoutineSource(PortName por
   if (end == nullptr) return nullptr;
   try {
     if (ports_.isService(port)) {
-      return std::make_shared<ServiceSource>(port, table, trailer, ports_, regions_, *incoming_,
+      return std::make_shared<ServiceSource>(port, table, trailer, ports_, regions_, incoming_,
                                              std::move(end), refusals_);
     }
     auto source = std::make_shared<PortSource>(port, table, trailer);
-    source->setChannel(ports_, regions_, *incoming_, std::move(end));
+    source->setChannel(ports_, regions_, incoming_, std::move(end));
     return source;
   } catch (const std::bad_alloc&) {
     return nullptr;
