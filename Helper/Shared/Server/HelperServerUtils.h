@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <functional>
@@ -101,7 +102,8 @@ class ServerContext {
   std::map<DeathWatch*, Client> clientWatches;
   std::map<PortName, std::shared_ptr<RoutineSource>> clientSources;
   std::uint32_t busyMask = 0;
-  bool stopFlag = false;
+
+  std::atomic<bool> stopFlag{false};  // looked at after each request, so that a lock would be felt
 };
 
 }  // namespace brenvik

@@ -73,6 +73,10 @@ class IncomingMessage {
     void* address;
     std::size_t length;
   };
+  // Whether it is nothing but its bytes, as most are: then there is nothing to be walked.
+  bool isPlain() const noexcept {
+    return (header().bits & kComplexBit) == 0 && fdCount_ == 0 && !descriptorsCut_;
+  }
   KernelReturn mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept;
 
   Received receive(int fd, int flags, std::size_t controlRoom, ClosingLine::Account account) noexcept;
