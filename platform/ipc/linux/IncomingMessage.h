@@ -92,14 +92,14 @@ class IncomingMessage {
   std::size_t mappingCount_ = 0;
   std::size_t nameCount_ = 0;
   std::array<UniqueFd, kMostRights> fds_;
-  std::array<Mapping, kMostRights> mappings_;
   std::array<PortName, kMostRights> names_;
-  // The control data first: it shares the pages of the counts above.
+  // The control data first: it shares the pages of the above. The mappings last: a check-in has none.
   struct Storage {
     alignas(cmsghdr) std::array<char, kControlRoom> control;
     alignas(16) std::array<std::byte, kLargestDatagram> bytes;
   };
   Storage storage_;
+  std::array<Mapping, kMostRights> mappings_;
 };
 
 }  // namespace brenvik
