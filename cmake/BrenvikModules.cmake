@@ -53,6 +53,20 @@ function(brenvik_library target)
   endif()
 endfunction()
 
+# brenvik_static_runtime(<program>)
+# Links the C++ library into a program whose start somebody waits for, where BRENVIK_STATIC_RUNTIME says so. To be called
+# in the folder of the program.
+macro(brenvik_static_runtime program)
+  if(BRENVIK_STATIC_RUNTIME)
+    # By hand instead of with -static-libstdc++, which puts -lm behind the C++ library: parts of that, which the linker
+    # drops again, ask for it, and then every start loads it for nothing. Here it is for our own code.
+    target_link_options(${program} PRIVATE -nodefaultlibs)
+    # The only libraries that are sure to come last on the command line are those of the folder.
+    set(CMAKE_CXX_STANDARD_LIBRARIES
+        "-lm -Wl,-Bstatic -lstdc++ -Wl,-Bdynamic -Wl,--start-group -lgcc -lgcc_eh -lc -Wl,--end-group")
+  endif()
+endmacro()
+
 # brenvik_tests(<target> [DEPENDS ...] [LABELS ...])
 # Builds <target>_tests of the folder's *Test.cpp and registers it with CTest.
 function(brenvik_tests target)

@@ -9,8 +9,8 @@
 
 #include <array>
 #include <charconv>
-#include <cstdio>
 
+#include "platform/base/ProcPath.h"
 #include "platform/base/UniqueFd.h"
 
 namespace brenvik {
@@ -45,9 +45,7 @@ std::optional<ProcessFacts> parseProcessStat(std::string_view text) noexcept {
 }
 
 std::optional<ProcessFacts> processFacts(pid_t pid) noexcept {
-  std::array<char, 32> path;
-  std::snprintf(path.data(), path.size(), "/proc/%d/stat", static_cast<int>(pid));
-  const UniqueFd file(::open(path.data(), O_RDONLY | O_CLOEXEC));
+  const UniqueFd file(::open(ProcPath(pid, "stat").c_str(), O_RDONLY | O_CLOEXEC));
   std::array<char, 1024> text;
   const ssize_t size = ::read(file.get(), text.data(), text.size());  // fails when nothing is open
   if (size <= 0) return std::nullopt;

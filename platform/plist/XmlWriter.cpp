@@ -102,10 +102,11 @@ char* formatReal(char* to, double number) noexcept {
 // Null when there is no such date in the format.
 char* formatDate(char* to, double seconds) noexcept {
   // The form has no fractions; the second that has begun stands. Not a number fails both comparisons.
-  const double whole = std::floor(seconds);
-  if (!(whole >= static_cast<double>(kFirstSecond) && whole < static_cast<double>(kSecondAfterLast)))
+  if (!(seconds >= static_cast<double>(kFirstSecond) && seconds < static_cast<double>(kSecondAfterLast)))
     return nullptr;
-  const std::chrono::seconds since{static_cast<std::int64_t>(whole)};
+  auto whole = static_cast<std::int64_t>(seconds);
+  if (static_cast<double>(whole) > seconds) --whole;
+  const std::chrono::seconds since{whole};
   const auto day = std::chrono::floor<std::chrono::days>(since);
   const std::chrono::year_month_day date{kDayZero + day};
   const std::int64_t second = (since - day).count();

@@ -135,23 +135,16 @@ void SetIdleCheck(ServerContext* server, std::function<bool()> idleCheck) {
 
 std::int32_t RunServer(ServerContext& server) {
   server.runLoop = &server.platform.loop;
-  const auto stopped = [&server] {
-    const Lock lock(server.lock);
-    return server.stopFlag;
-  };
-  if (stopped()) return 0;
+  if (server.stopFlag) return 0;
   RunResult result{};
   do {
     result = server.runLoop->run(kNoTimeOut, ReturnAfterSource::yes);
-  } while (!stopped());
+  } while (!server.stopFlag);
   return static_cast<std::int32_t>(result);
 }
 
 std::int32_t StopServer(ServerContext& server) {
-  {
-    const Lock lock(server.lock);
-    server.stopFlag = true;
-  }
+  server.stopFlag = true;
   if (server.runLoop != nullptr) server.runLoop->stop();
   return 0;
 }

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <array>
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <functional>
@@ -111,7 +112,8 @@ class ServerContext {
   std::array<const char*, 32> busyReasons{};  // of the bits that are set
   std::chrono::nanoseconds idleSince{0};      // when the idle timer was armed
   bool isKeptByIdleCheck = false;             // its last answer
-  bool stopFlag = false;
+
+  std::atomic<bool> stopFlag{false};  // looked at after each request, so that a lock would be felt
 };
 
 }  // namespace brenvik

@@ -95,6 +95,7 @@ KernelReturn IncomingMessage::mapRegion(int fd, std::uint32_t length, std::uint6
 
 KernelReturn IncomingMessage::checkForm() const noexcept {
   if (bytesCut_) return mig::badArguments;
+  if (isPlain()) return kern::success;
   const auto walk = walkDescriptors({storage_.bytes.data(), length_});
   if (!walk) return mig::badArguments;
   if (!descriptorsCut_) return walk->rights == fdCount_ ? kern::success : mig::badArguments;
@@ -106,6 +107,12 @@ KernelReturn IncomingMessage::checkForm() const noexcept {
 
 KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
   if (const KernelReturn code = checkForm(); code != kern::success) return code;
+  auto& header = *reinterpret_cast<MessageHeader*>(storage_.bytes.data());
+  if (isPlain()) {
+    header.size = static_cast<std::uint32_t>(length_);
+    header.localPort = localPort;
+    return kern::success;
+  }
   const std::span<const std::byte> datagram(storage_.bytes.data(), length_);
   const auto walk = walkDescriptors(datagram);
 
@@ -134,7 +141,6 @@ KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
     }
     std::memcpy(at + offsetof(OutOfLineDescriptor, address), &address, sizeof address);
   }
-  auto& header = *reinterpret_cast<MessageHeader*>(storage_.bytes.data());
   header.size = walk->messageSize;
   header.localPort = localPort;
   return kern::success;

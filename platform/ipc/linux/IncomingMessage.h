@@ -73,6 +73,10 @@ class IncomingMessage {
     void* address;
     std::size_t length;
   };
+  // Whether it is nothing but its bytes, as most are: then there is nothing to be walked.
+  bool isPlain() const noexcept {
+    return (header().bits & kComplexBit) == 0 && fdCount_ == 0 && !descriptorsCut_;
+  }
   KernelReturn mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept;
 
   Received receive(int fd, int flags, std::size_t controlRoom, ClosingLine::Account account) noexcept;
@@ -88,14 +92,14 @@ class IncomingMessage {
   std::size_t mappingCount_ = 0;
   std::size_t nameCount_ = 0;
   std::array<UniqueFd, kMostRights> fds_;
-  std::array<Mapping, kMostRights> mappings_;
   std::array<PortName, kMostRights> names_;
-  // The control data first: it shares the pages of the counts above.
+  // The control data first: it shares the pages of the above. The mappings last: a check-in has none.
   struct Storage {
     alignas(cmsghdr) std::array<char, kControlRoom> control;
     alignas(16) std::array<std::byte, kLargestDatagram> bytes;
   };
   Storage storage_;
+  std::array<Mapping, kMostRights> mappings_;
 };
 
 }  // namespace brenvik

@@ -10,9 +10,9 @@
 #include <array>
 #include <cerrno>
 #include <charconv>
-#include <cstdio>
 #include <string_view>
 
+#include "platform/base/ProcPath.h"
 #include "platform/base/ProcessFacts.h"
 #include "platform/base/UniqueFd.h"
 
@@ -26,9 +26,7 @@ namespace {
 constexpr std::uint32_t kNoLoginUid = 0xFFFFFFFF;
 
 std::uint32_t loginUid(pid_t pid) noexcept {
-  std::array<char, 32> path;
-  std::snprintf(path.data(), path.size(), "/proc/%d/loginuid", static_cast<int>(pid));
-  const UniqueFd file(::open(path.data(), O_RDONLY | O_CLOEXEC));
+  const UniqueFd file(::open(ProcPath(pid, "loginuid").c_str(), O_RDONLY | O_CLOEXEC));
   std::array<char, 16> text;
   const ssize_t size = ::read(file.get(), text.data(), text.size());
   std::uint32_t uid = kNoLoginUid;

@@ -109,15 +109,16 @@ class ChannelOwner {
   virtual std::uint32_t nextSequence() noexcept = 0;
   virtual void admitted(Channel& channel) noexcept = 0;
 
-  // Whether the other ends of its channels are strangers: what they send is looked at before it is taken.
-  virtual bool isDoor() const noexcept { return false; }
-  // Of a door. Whether the channel's next message may be looked at; if not, the owner resumes the channel
+  // Of a door, whose channels' other ends are strangers: what they send is looked at before it is taken.
+  enum class IsDoor { no, yes };
+
+  // Whether the channel's next message may be looked at; if not, the owner resumes the channel
   // later.
   virtual bool mayBeRead(Channel&) noexcept { return true; }
-  // Around the handler: makes sure that it finds descriptors. False: there are none, and it must not be
-  // asked.
+  // The same. Around the handler: makes sure that it finds descriptors. False: there are none, and it must
+  // not be asked.
   virtual bool beginService(Channel&) noexcept { return true; }
-  // Before the answer. True when the channel is to be closed after it.
+  // The same. Before the answer. True when the channel is to be closed after it.
   virtual bool endService(Channel&, KernelReturn) noexcept { return false; }
   // Has the channel's next message dropped elsewhere and resumes the channel then. False when that cannot be
   // done.
@@ -131,10 +132,12 @@ class ChannelOwner {
 class Channel : public std::enable_shared_from_this<Channel>, public ConnectionBooks::Entry {
  public:
   // `account`, `peer`: of the process that made the connection, when the owner is a door.
-  Channel(ChannelOwner& owner, SystemPortSpace& ports, SystemRegions& regions, IncomingMessage& incoming,
-          SystemPortSpace::SharedFd fd, uid_t account = ClosingLine::kClients, pid_t peer = 0) noexcept
+  Channel(ChannelOwner& owner, ChannelOwner::IsDoor isDoor, SystemPortSpace& ports, SystemRegions& regions,
+          IncomingMessage& incoming, SystemPortSpace::SharedFd fd, uid_t account = ClosingLine::kClients,
+          pid_t peer = 0) noexcept
       : Entry(account),
         owner_(&owner),
+        isDoor_(isDoor == ChannelOwner::IsDoor::yes),
         ports_(ports),
         regions_(regions),
         incoming_(incoming),
@@ -180,15 +183,14 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
   void ready(std::uint32_t events) noexcept {
     const auto keptAlive = shared_from_this();
     if (pending_ != nullptr && !sendPending(events)) return;
-    const bool isDoor = owner_ != nullptr && owner_->isDoor();
     for (int taken = 0; taken < kMessageBudget && pending_ == nullptr && owner_ != nullptr; ++taken) {
-      if (isDoor && !owner_->mayBeRead(*this)) {
+      if (isDoor_ && !owner_->mayBeRead(*this)) {
         // Who has gone does not wait for an answer, nor keep the place of one who does.
         if ((events & (EPOLLHUP | EPOLLERR)) != 0) return end();
         isLimited_ = true;
         return pause();
       }
-      const auto received = isDoor ? incoming_.peek(fd_->get(), account()) : incoming_.receive(fd_->get());
+      const auto received = isDoor_ ? incoming_.peek(fd_->get(), account()) : incoming_.receive(fd_->get());
       if (received == IncomingMessage::Received::endOfChannel) return end();
       if (received == IncomingMessage::Received::nothing) break;
       const bool answerWanted = incoming_.hasHeader() && incoming_.header().replyPort != kNullPort;
@@ -254,6 +256,7 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
   }
 
   ChannelOwner* owner_;  // null once the channel has ended
+  const bool isDoor_;    // whether the owner is one
   SystemPortSpace& ports_;
   SystemRegions& regions_;
   IncomingMessage& incoming_;
@@ -276,7 +279,7 @@ Outcome Channel::serveInto(Reply& reply, std::byte* bytes) noexcept {
     return Outcome::refused;
   };
   RoutineTable::Handler handler = nullptr;
-  if (owner_->isDoor()) {
+  if (isDoor_) {
     // The form first: what a stranger sends along is looked at when it belongs to a message that is known.
     if (const KernelReturn code = incoming_.checkForm(); code != kern::success) return refuse(code);
     handler = owner_->table().find(incoming_.header().id);
@@ -285,7 +288,7 @@ Outcome Channel::serveInto(Reply& reply, std::byte* bytes) noexcept {
   if (const KernelReturn code = incoming_.unpack(owner_->port()); code != kern::success) return refuse(code);
   if (handler == nullptr) handler = owner_->table().find(incoming_.header().id);
   if (handler == nullptr) return refuse(mig::badId);
-  if (!owner_->beginService(*this)) return refuse(kern::resourceShortage);
+  if (isDoor_ && !owner_->beginService(*this)) return refuse(kern::resourceShortage);
   const bool wantsTrailer = owner_->wantTrailer() == WantTrailer::yes && incoming_.sender();
   if (wantsTrailer && pinPeer(fd_->get(), peer_, incoming_.sender()->pid) == PeerPin::refused) {
     return refuse(kern::invalidSecurity);
@@ -303,9 +306,8 @@ Outcome Channel::serveInto(Reply& reply, std::byte* bytes) noexcept {
 }
 
 void Channel::serve() noexcept {
-  const bool isDoor = owner_->isDoor();
   if (!incoming_.hasHeader()) {  // dropped without an answer
-    const bool isTaken = !isDoor || incoming_.take(fd_->get());
+    const bool isTaken = !isDoor_ || incoming_.take(fd_->get());
     incoming_.release(false);
     return isTaken ? void() : discard();
   }
@@ -317,9 +319,9 @@ void Channel::serve() noexcept {
   const MessageHeader request = incoming_.header();
   const KernelReturn code =
       (reply.header().bits & kComplexBit) != 0 ? kern::success : reply.as<StatusReply>().returnCode;
-  const bool isTaken = !isDoor || owner_ == nullptr || incoming_.take(fd_->get());
+  const bool isTaken = !isDoor_ || owner_ == nullptr || incoming_.take(fd_->get());
   if (owner_ != nullptr && outcome == Outcome::accepted) owner_->admitted(*this);
-  if (isDoor && owner_ != nullptr) endsOnResume_ = owner_->endService(*this, code);
+  if (isDoor_ && owner_ != nullptr) endsOnResume_ = owner_->endService(*this, code);
 
   out.size = reply.header().size;
   reply.header().replyPort = kNullPort;
@@ -329,7 +331,7 @@ void Channel::serve() noexcept {
   answer(out, request.replyPort != kNullPort && owner_ != nullptr);
   // Only now: a routine's region or right is good until its reply is on its way.
   incoming_.release(outcome == Outcome::accepted);
-  if (!isDoor || owner_ == nullptr) return;
+  if (!isDoor_ || owner_ == nullptr) return;
   if (!isTaken) return discard();
   if (endsOnResume_) end();
 }
@@ -404,8 +406,8 @@ class PortSource final : public RoutineSource, private ChannelOwner {
 
   void setChannel(SystemPortSpace& ports, SystemRegions& regions, IncomingMessage& incoming,
                   SystemPortSpace::SharedFd fd) {
-    channel_ =
-        std::make_shared<Channel>(static_cast<ChannelOwner&>(*this), ports, regions, incoming, std::move(fd));
+    channel_ = std::make_shared<Channel>(static_cast<ChannelOwner&>(*this), IsDoor::no, ports, regions,
+                                         incoming, std::move(fd));
   }
   bool addTo(RunLoop& loop) noexcept override {
     try {
@@ -478,7 +480,6 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   WantTrailer wantTrailer() const noexcept override { return trailer_; }
   PortName port() const noexcept override { return port_; }
   std::uint32_t nextSequence() noexcept override { return sequence_++; }
-  bool isDoor() const noexcept override { return true; }
   void admitted(Channel& channel) noexcept override {
     books_.admit(channel);
     drop(books_.overdueAdmitted());
@@ -608,7 +609,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
     socklen_t size = sizeof peer;
     (void)::getsockopt(connection.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size);
     const auto channel =
-        std::make_shared<Channel>(static_cast<ChannelOwner&>(*this), ports_, regions_, incoming_,
+        std::make_shared<Channel>(static_cast<ChannelOwner&>(*this), IsDoor::yes, ports_, regions_, incoming_,
                                   ports_.share(std::move(connection), peer.uid), peer.uid, peer.pid);
     if (!channel->addTo(*loop_)) return;
     channels_.emplace(channel.get(), channel);
@@ -728,10 +729,7 @@ class SocketDeathWatch final : public DeathWatch {
 }  // namespace
 
 SystemPortSources::SystemPortSources(SystemPortSpace& ports, SystemRegions& regions, Refusals refusals)
-    : ports_(ports),
-      regions_(regions),
-      refusals_(refusals),
-      incoming_(std::make_unique<IncomingMessage>(ports)) {}
+    : ports_(ports), regions_(regions), refusals_(refusals), incoming_(ports) {}
 
 SystemPortSources::~SystemPortSources() = default;
 
@@ -741,11 +739,11 @@ std::shared_ptr<RoutineSource> SystemPortSources::makeRoutineSource(PortName por
   if (end == nullptr) return nullptr;
   try {
     if (ports_.isService(port)) {
-      return std::make_shared<ServiceSource>(port, table, trailer, ports_, regions_, *incoming_,
+      return std::make_shared<ServiceSource>(port, table, trailer, ports_, regions_, incoming_,
                                              std::move(end), refusals_);
     }
     auto source = std::make_shared<PortSource>(port, table, trailer);
-    source->setChannel(ports_, regions_, *incoming_, std::move(end));
+    source->setChannel(ports_, regions_, incoming_, std::move(end));
     return source;
   } catch (const std::bad_alloc&) {
     return nullptr;

@@ -36,7 +36,7 @@ class SystemPortSources final : public PortSources {
   SystemRegions& regions_;
   const Refusals refusals_;
   // One message at a time is served in the whole process, so one buffer serves every channel.
-  const std::unique_ptr<IncomingMessage> incoming_;
+  IncomingMessage incoming_;
 };
 
 }  // namespace brenvik

@@ -253,22 +253,30 @@ namespace {
 
 class PidfdExitSource final : public ProcessExitSource {
  public:
-  // `onGlobal` runs a task on the global queue, or drops it when there is none any more.
+  // `onGlobal` runs a task on the global queue, or drops it when there is none any more. Without `pidfd` the
+  // process has gone.
   PidfdExitSource(const std::shared_ptr<EventLoop>& loop, std::function<void(WorkQueue::Task)> onGlobal,
-                  UniqueFd pidfd, WorkQueue::Task onExit, WorkQueue::Task onCancel)
+                  pid_t pid, std::uint32_t startTime, UniqueFd pidfd, WorkQueue::Task onExit,
+                  WorkQueue::Task onCancel)
       : loop_(loop), state_(std::make_shared<State>()) {
     state_->onGlobal = std::move(onGlobal);
+    state_->pid = pid;
+    state_->startTime = startTime;
     state_->pidfd = std::move(pidfd);
     state_->onExit = std::move(onExit);
     state_->onCancel = std::move(onCancel);
   }
   ~PidfdExitSource() override { end(false); }
 
+  // Never within this call: who was let in waits for an answer, and for that none of this is needed.
   void activate() override {
-    onLoop([state = state_, weak = loop_] {
+    const auto alive = loop_.lock();
+    if (alive == nullptr) return;
+    alive->post([state = state_, weak = loop_] {
       const auto loop = weak.lock();
       if (state->cancelled.load() || loop == nullptr) return;
-      if (!state->pidfd.isValid()) return tell(state);  // it was gone before it could be watched
+      // The id may have been given to another process between the caller's look and the opening.
+      if (!state->pidfd.isValid() || processStartTime(state->pid) != state->startTime) return tell(state);
       state->source = loop->addDescriptor(state->pidfd.get(), EPOLLIN, [state](std::uint32_t) {
         state->source.reset();
         tell(state);
@@ -284,6 +292,8 @@ class PidfdExitSource final : public ProcessExitSource {
     std::function<void(WorkQueue::Task)> onGlobal;
     WorkQueue::Task onExit;
     WorkQueue::Task onCancel;
+    pid_t pid = 0;
+    std::uint32_t startTime = 0;
     UniqueFd pidfd;
     std::unique_ptr<DescriptorSource> source;  // loop thread only
   };
@@ -343,15 +353,17 @@ RunResult SystemRunLoop::run(std::chrono::duration<double> timeOut, ReturnAfterS
   const bool endless = !(timeOut < std::chrono::hours(24 * 36525));
   const auto deadline = endless ? Clock::time_point::max()
                                 : Clock::now() + std::chrono::duration_cast<Clock::duration>(timeOut);
+  // Looked at first: each call that is served passes here twice, and an exchange waits for the memory bus.
+  const auto takeStop = [this] { return stopped_.load() && stopped_.exchange(false); };
   for (;;) {
-    if (stopped_.exchange(false)) return RunResult::stopped;
+    if (takeStop()) return RunResult::stopped;
     std::uint64_t wait = kNoTimeOut;
     if (!endless) {
       const auto left = std::chrono::ceil<std::chrono::microseconds>(deadline - Clock::now());
       wait = left.count() <= 0 ? 0 : static_cast<std::uint64_t>(left.count());
     }
     const int handled = loop_->runOnce(wait);
-    if (stopped_.exchange(false)) return RunResult::stopped;
+    if (takeStop()) return RunResult::stopped;
     if (handled < 0) return RunResult::finished;
     if (handled > 0 && returnAfterSource == ReturnAfterSource::yes) return RunResult::handledSource;
     if (handled == 0 && wait == 0) return RunResult::timedOut;
@@ -396,8 +408,6 @@ std::unique_ptr<ProcessExitSource> SystemQueues::makeProcessExitSource(pid_t pid
                                                                        WorkQueue::Task onCancel) {
   UniqueFd pidfd(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0U)));
   if (!pidfd.isValid() && errno != ESRCH) return nullptr;
-  // The id may have been given to another process since the caller learned it.
-  if (pidfd.isValid() && processStartTime(pid) != startTime) pidfd.reset();
   const auto onGlobal = [weak = std::weak_ptr<Maker>(maker_),
                          weakLoop = std::weak_ptr<EventLoop>(mainLoop_)](WorkQueue::Task task) {
     const auto maker = weak.lock();
@@ -409,8 +419,8 @@ std::unique_ptr<ProcessExitSource> SystemQueues::makeProcessExitSource(pid_t pid
       if (const auto loop = weakLoop.lock()) loop->post(std::move(task));
     }
   };
-  return std::make_unique<PidfdExitSource>(mainLoop_, onGlobal, std::move(pidfd), std::move(onExit),
-                                           std::move(onCancel));
+  return std::make_unique<PidfdExitSource>(mainLoop_, onGlobal, pid, startTime, std::move(pidfd),
+                                           std::move(onExit), std::move(onCancel));
 }
 
 }  // namespace brenvik

@@ -16,9 +16,11 @@
 #include <unistd.h>
 
 #include <array>
+#include <atomic>
 #include <filesystem>
 #include <fstream>
 #include <future>
+#include <iterator>
 #include <limits>
 #include <new>
 #include <set>
@@ -683,6 +685,10 @@ class ProcessExitTest : public SystemQueuesTest {
     ::close(pipe[0]);
     return {pid, UniqueFd(pipe[1])};
   }
+  static std::size_t numberOfThreads() {
+    const std::filesystem::directory_iterator tasks("/proc/self/task");
+    return static_cast<std::size_t>(std::distance(begin(tasks), end(tasks)));
+  }
 };
 
 TEST_F(ProcessExitTest, TellsOnceThatTheProcessHasExited) {
@@ -694,6 +700,8 @@ TEST_F(ProcessExitTest, TellsOnceThatTheProcessHasExited) {
   ASSERT_NE(source, nullptr);
   source->activate();
   life.reset();
+  // One turn begins the watching, another hears of the exit.
+  ASSERT_EQ(loop->run(20s, ReturnAfterSource::yes), RunResult::handledSource);
   ASSERT_EQ(loop->run(20s, ReturnAfterSource::yes), RunResult::handledSource);
   EXPECT_TRUE(told.get_future().get());
   ::waitpid(pid, nullptr, 0);
@@ -751,13 +759,35 @@ TEST_F(ProcessExitTest, MayBeMadeOnAnyThreadAndOutliveTheQueues) {
   ::waitpid(latePid, nullptr, 0);
 }
 
-TEST_F(ProcessExitTest, TellsAtOnceWhenTheProcessIsGoneOrTheIdNamesAnother) {
+TEST_F(ProcessExitTest, TheActivationItselfLooksAtNothing) {
+  SystemQueues queues(*loop);
+  auto [pid, life] = child();
+  std::atomic<bool> isTold{false};
+  std::promise<void> told;
+  const auto wrong = queues.makeProcessExitSource(pid, processStartTime(pid).value() + 1,
+                                                  [&] {
+                                                    isTold = true;
+                                                    told.set_value();
+                                                  },
+                                                  {});
+  const std::size_t before = numberOfThreads();
+  wrong->activate();
+  EXPECT_LE(numberOfThreads(), before) << "it was told to the global queue";
+  EXPECT_FALSE(isTold) << "whoever activates it may have an answer to give first";
+  ASSERT_EQ(loop->run(20s, ReturnAfterSource::yes), RunResult::handledSource);
+  told.get_future().wait();
+  life.reset();
+  ::waitpid(pid, nullptr, 0);
+}
+
+TEST_F(ProcessExitTest, TellsWithTheNextTurnWhenTheProcessIsGoneOrTheIdNamesAnother) {
   SystemQueues queues(*loop);
   auto [pid, life] = child();
   const std::uint32_t startTime = processStartTime(pid).value();
   std::promise<void> another;
   const auto wrong = queues.makeProcessExitSource(pid, startTime + 1, [&] { another.set_value(); }, {});
-  wrong->activate();  // on the loop's own thread: nothing has to be waited for
+  wrong->activate();
+  ASSERT_EQ(loop->run(20s, ReturnAfterSource::yes), RunResult::handledSource);
   another.get_future().wait();
   life.reset();
   ::waitpid(pid, nullptr, 0);
@@ -765,6 +795,7 @@ TEST_F(ProcessExitTest, TellsAtOnceWhenTheProcessIsGoneOrTheIdNamesAnother) {
   const auto source = queues.makeProcessExitSource(pid, startTime, [&] { gone.set_value(); }, {});
   ASSERT_NE(source, nullptr);
   source->activate();
+  ASSERT_EQ(loop->run(20s, ReturnAfterSource::yes), RunResult::handledSource);
   gone.get_future().wait();
 }
 

@@ -39,7 +39,7 @@ constexpr const char kChangeable[] = "not owned by root, or others may write to 
 // readdir(3), which asks three more questions of the system at every first check-in.
 std::optional<std::vector<std::string>> entitlementFilesIn(int directory) {
   std::vector<std::string> names;
-  alignas(dirent64) std::array<char, 4096> entries;
+  alignas(dirent64) std::array<char, 1024> entries;  // some thirty files at a time
   for (;;) {
     const ssize_t size = ::getdents64(directory, entries.data(), entries.size());
     if (size < 0) return std::nullopt;
