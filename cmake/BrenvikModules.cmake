@@ -59,7 +59,8 @@ endfunction()
 macro(brenvik_static_runtime program)
   if(BRENVIK_STATIC_RUNTIME)
     # By hand instead of with -static-libstdc++, which puts -lm behind the C++ library: parts of that, which the linker
-    # drops again, ask for it, and then every start loads it for nothing. Here it is for our own code.
+    # drops again, ask for it, and then every start loads it for nothing. Here it is for our own code. See
+    # docs/decisions/16-start.md.
     target_link_options(${program} PRIVATE -nodefaultlibs)
     # The only libraries that are sure to come last on the command line are those of the folder.
     set(CMAKE_CXX_STANDARD_LIBRARIES

@@ -57,7 +57,7 @@ struct EntitlementCheck::State {
 };
 
 EntitlementCheck::EntitlementCheck(TaskSecurity& security, WorkQueues& queues, RefusalLog::Clock now)
-    : security_(security), queues_(queues), refusals_(std::move(now)), state_(std::make_shared<State>()) {}
+    : security_(security), queues_(queues), state_(std::make_shared<State>()), refusals_(std::move(now)) {}
 
 std::chrono::nanoseconds EntitlementCheck::steadyTime() {
   return std::chrono::steady_clock::now().time_since_epoch();

@@ -48,8 +48,8 @@ class EntitlementCheck {
 
   TaskSecurity& security_;
   WorkQueues& queues_;
-  RefusalLog refusals_;
   const std::shared_ptr<State> state_;  // an exit handler that is late finds it, or finds it gone
+  RefusalLog refusals_;
 };
 
 }  // namespace brenvik

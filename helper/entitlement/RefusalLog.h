@@ -58,9 +58,9 @@ class RefusalLog {
 
   const Clock now_;
   std::mutex mutex_;
-  std::size_t count_ = 0;
-  std::array<Account, kMostCallers> callers_;
   std::optional<Others> others_;
+  std::size_t count_ = 0;
+  std::array<Account, kMostCallers> callers_;  // last: pages that nobody touches until somebody is refused
 };
 
 }  // namespace brenvik

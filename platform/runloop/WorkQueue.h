@@ -91,8 +91,9 @@ class WorkQueues {
   virtual std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) = 0;
 
   // Watches the process `pid` whose start time (field 22 of /proc/PID/stat, low 32 bits) is `startTime`. The
-  // event handler runs on global(), once the main run loop runs; so it does when that process is gone already
-  // or the id names another one. Null when the kernel gives no descriptor for it.
+  // event handler runs on global(), once the main run loop runs; so it does when that process is gone
+  // already, when the id names another one, and when the system lacks what it takes to watch it. Null when
+  // the kernel gives no descriptor for it.
   virtual std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t startTime,
                                                                    WorkQueue::Task onExit,
                                                                    WorkQueue::Task onCancel) = 0;

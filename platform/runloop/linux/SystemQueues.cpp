@@ -277,10 +277,16 @@ class PidfdExitSource final : public ProcessExitSource {
       if (state->cancelled.load() || loop == nullptr) return;
       // The id may have been given to another process between the caller's look and the opening.
       if (!state->pidfd.isValid() || processStartTime(state->pid) != state->startTime) return tell(state);
-      state->source = loop->addDescriptor(state->pidfd.get(), EPOLLIN, [state](std::uint32_t) {
-        state->source.reset();
-        tell(state);
-      });
+      try {
+        state->source = loop->addDescriptor(state->pidfd.get(), EPOLLIN, [state](std::uint32_t) {
+          state->source.reset();
+          tell(state);
+        });
+      } catch (const std::bad_alloc&) {
+        // As without a source.
+      }
+      // What would never be heard of is better told too early: nobody relies on it any more.
+      if (state->source == nullptr) tell(state);
     });
   }
   void cancel() noexcept override { end(true); }
