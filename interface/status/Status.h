@@ -19,6 +19,13 @@ inline constexpr std::string_view kStatusSocketSuffix = ".status";
 // A reader takes nothing larger. Names and words in it are short, so a real one stays far below.
 inline constexpr std::size_t kLargestStatus = 16384;
 
+// Something that happened, and how long ago.
+struct StatusEvent {
+  std::string outcome;
+  std::chrono::milliseconds age{0};
+  bool operator==(const StatusEvent&) const = default;
+};
+
 struct StatusReport {
   // Reasons for busy tokens, as they are sent; see whatHolds() for people's words.
   static constexpr const char* kDatabaseCheck = "database-check";
@@ -34,12 +41,7 @@ struct StatusReport {
     std::uint64_t bytes = 0;
     bool operator==(const Traffic&) const = default;
   };
-  // Something that happened, and how long ago.
-  struct Event {
-    std::string outcome;
-    std::chrono::milliseconds age{0};
-    bool operator==(const Event&) const = default;
-  };
+  using Event = StatusEvent;
   struct Database {
     std::string type;
     Event lastCheck;  // "checking", "updated", "no-update-required" or "failed"
