@@ -36,6 +36,7 @@ class RemoteManager final : public ContactsChannelManager {
     if (result == WorkerResult::done) result = channel_.receive(&message, deadline_);
     if (result == WorkerResult::done) {
       if (const auto outcome = stores::decodeContactsOutcome(message)) return *outcome;
+      channel_.discard(&message);
       result = WorkerResult::malformed;
     }
     if (result == WorkerResult::outOfMemory) {
@@ -58,6 +59,7 @@ class RemoteManager final : public ContactsChannelManager {
             if (answer->error) *error = std::move(answer->error);
             return answer->done;
           }
+          channel_.discard(&message);
           result = WorkerResult::malformed;
         }
         failWith(result);

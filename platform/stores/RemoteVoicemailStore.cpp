@@ -73,6 +73,7 @@ RemoteVoicemailStore::Result RemoteVoicemailStore::exchange(VoicemailRequest* re
     const WorkerResult received = channel_.receive(&message, deadline);
     auto decoded = received == WorkerResult::done ? stores::decodeVoicemailAnswer(message) : std::nullopt;
     if (!decoded || decoded->serial != request->serial) {
+      channel_.discard(&message);
       // Of an answer that comes later nobody would know what it answers.
       worker_.giveUp(&channel_);
       return received == WorkerResult::outOfMemory ? Result::outOfMemory : Result::failed;
