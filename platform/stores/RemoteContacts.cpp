@@ -26,17 +26,18 @@ class RemoteManager final : public ContactsChannelManager {
     if (!copy.isValid()) return stores::ContactsOutcome::outOfMemory;
     message.descriptors.push_back(std::move(copy));
     WorkerResult result = WorkerResult::closed;
-    // A worker that has died since the last request is replaced.
+    WorkerMessage answer;
+    // A worker that dies is replaced once: nothing is changed yet.
     for (int attempt = 0; attempt < 2 && result == WorkerResult::closed; ++attempt) {
       result = worker_.open(static_cast<std::uint32_t>(stores::Work::contacts), &channel_);
       if (result != WorkerResult::done) break;
       result = channel_.send(message);
+      if (result == WorkerResult::done) result = channel_.receive(&answer, deadline_);
       if (result == WorkerResult::closed) worker_.giveUp(&channel_);
     }
-    if (result == WorkerResult::done) result = channel_.receive(&message, deadline_);
     if (result == WorkerResult::done) {
-      if (const auto outcome = stores::decodeContactsOutcome(message)) return *outcome;
-      channel_.discard(&message);
+      if (const auto outcome = stores::decodeContactsOutcome(answer)) return *outcome;
+      channel_.discard(&answer);
       result = WorkerResult::malformed;
     }
     if (result == WorkerResult::outOfMemory) {

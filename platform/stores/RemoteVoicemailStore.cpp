@@ -64,6 +64,7 @@ RemoteVoicemailStore::Result RemoteVoicemailStore::exchange(VoicemailRequest* re
     case StoreFolder::State::outOfMemory:
       return Result::outOfMemory;
   }
+  bool isRepeated = false;
   for (;;) {
     request->serial = ++serial_;
     const WorkerResult sent = send(*request, folder);
@@ -74,8 +75,11 @@ RemoteVoicemailStore::Result RemoteVoicemailStore::exchange(VoicemailRequest* re
     auto decoded = received == WorkerResult::done ? stores::decodeVoicemailAnswer(message) : std::nullopt;
     if (!decoded || decoded->serial != request->serial) {
       channel_.discard(&message);
+      const bool hasDied = received == WorkerResult::closed;
       // Of an answer that comes later nobody would know what it answers.
       worker_.giveUp(&channel_);
+      // Whatever it was ended by; each operation is the same when it is done twice.
+      if (hasDied && !std::exchange(isRepeated, true)) continue;
       return received == WorkerResult::outOfMemory ? Result::outOfMemory : Result::failed;
     }
     if (decoded->outcome == VoicemailOutcome::notAllowed) {

@@ -298,6 +298,7 @@ class Worker(StoresTest):
         for name in ("CapInh", "CapPrm", "CapEff", "CapAmb"):
             self.assertEqual(int(status[name], 16), 0, name)
         self.assertEqual(status["NoNewPrivs"], "1")
+        self.assertEqual(status["Seccomp"], "2", "it opens no network socket")
         self.assertEqual(pathlib.Path(f"/proc/{worker}/environ").read_bytes(), b"")
         # Its own account's processes cannot look into it, nor at what it was handed.
         self.assertEqual(as_account("mobile", lambda: int(os.access(f"/proc/{worker}/mem", os.R_OK))), 0)

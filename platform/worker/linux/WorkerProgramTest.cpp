@@ -9,6 +9,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <csignal>
 #include <cstring>
 #include <filesystem>
@@ -120,11 +121,17 @@ TEST_F(WorkerProgramTest, AWorkerHasNothingButWhatItWasGiven) {
   const std::uint32_t descriptors = reader.u32();
   const std::uint32_t variables = reader.u32();
   const std::uint64_t limit = reader.u64();
+  const int internet = static_cast<int>(reader.u32());
+  const int netlink = static_cast<int>(reader.u32());
+  const int local = static_cast<int>(reader.u32());
   ASSERT_TRUE(reader.whole());
   EXPECT_EQ(capabilities, "0000000000000000");
   EXPECT_EQ(noNewPrivileges, "1");
   EXPECT_EQ(variables, 0U);
   EXPECT_EQ(limit, 256U);
+  EXPECT_EQ(internet, EAFNOSUPPORT);
+  EXPECT_EQ(netlink, EAFNOSUPPORT);
+  EXPECT_EQ(local, 0);
   // Three standard ones, the connection, this channel, and the journal's socket if it has one.
   EXPECT_LE(descriptors, 6U);
   if (::geteuid() == 0) {
