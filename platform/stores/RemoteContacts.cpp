@@ -41,7 +41,7 @@ class RemoteManager final : public ContactsChannelManager {
       result = WorkerResult::malformed;
     }
     if (result == WorkerResult::outOfMemory) {
-      worker_.giveUp(&channel_);
+      channel_.close();
       return stores::ContactsOutcome::outOfMemory;
     }
     failWith(result);
@@ -68,7 +68,7 @@ class RemoteManager final : public ContactsChannelManager {
       *error = failure_;
     } catch (const std::bad_alloc&) {
       // The error stays absent: it needs memory, too. What the worker still says answers nothing any more.
-      worker_.giveUp(&channel_);
+      channel_.close();
       failure_ = "out of memory";
     }
     return false;
@@ -76,7 +76,11 @@ class RemoteManager final : public ContactsChannelManager {
 
  private:
   void failWith(WorkerResult result) noexcept {
-    worker_.giveUp(&channel_);
+    // A lack of memory is this process's own.
+    if (result == WorkerResult::outOfMemory)
+      channel_.close();
+    else
+      worker_.giveUp(&channel_);
     switch (result) {
       case WorkerResult::timedOut:
         failure_ = "the contacts did not answer in time";

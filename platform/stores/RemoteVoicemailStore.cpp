@@ -43,6 +43,10 @@ WorkerResult RemoteVoicemailStore::send(const VoicemailRequest& request, const S
       }
       return sent;
     }
+    if (sent == WorkerResult::outOfMemory) {
+      channel_.close();
+      return sent;
+    }
     worker_.giveUp(&channel_);
     if (sent != WorkerResult::closed || attempt > 0) return sent;
   }
@@ -72,6 +76,10 @@ RemoteVoicemailStore::Result RemoteVoicemailStore::exchange(VoicemailRequest* re
       return sent == WorkerResult::outOfMemory ? Result::outOfMemory : Result::failed;
     WorkerMessage message;
     const WorkerResult received = channel_.receive(&message, deadline);
+    if (received == WorkerResult::outOfMemory) {
+      channel_.close();
+      return Result::outOfMemory;
+    }
     auto decoded = received == WorkerResult::done ? stores::decodeVoicemailAnswer(message) : std::nullopt;
     if (!decoded || decoded->serial != request->serial) {
       channel_.discard(&message);
@@ -80,7 +88,7 @@ RemoteVoicemailStore::Result RemoteVoicemailStore::exchange(VoicemailRequest* re
       worker_.giveUp(&channel_);
       // Whatever it was ended by; each operation is the same when it is done twice.
       if (hasDied && !std::exchange(isRepeated, true)) continue;
-      return received == WorkerResult::outOfMemory ? Result::outOfMemory : Result::failed;
+      return Result::failed;
     }
     if (decoded->outcome == VoicemailOutcome::notAllowed) {
       if (request->insists) return Result::failed;
@@ -108,8 +116,8 @@ bool RemoteVoicemailStore::perform(Operation operation, const std::string* key, 
     isToldByWorker = result == Result::outOfMemory && answer.outcome == VoicemailOutcome::outOfMemory;
     if (found != nullptr) *found = std::move(answer.token);
   } catch (const std::bad_alloc&) {
-    // What the worker says now would be taken for the next answer.
-    worker_.giveUp(&channel_);
+    // What the worker says now answers nothing any more. The lack is this process's own.
+    channel_.close();
   }
   if (result != Result::done && !isToldByWorker) {
     if (stores::writes(operation))
