@@ -26,20 +26,22 @@ class RemoteManager final : public ContactsChannelManager {
     if (!copy.isValid()) return stores::ContactsOutcome::outOfMemory;
     message.descriptors.push_back(std::move(copy));
     WorkerResult result = WorkerResult::closed;
-    // A worker that has died since the last request is replaced.
+    WorkerMessage answer;
+    // A worker that dies is replaced once: nothing is changed yet.
     for (int attempt = 0; attempt < 2 && result == WorkerResult::closed; ++attempt) {
       result = worker_.open(static_cast<std::uint32_t>(stores::Work::contacts), &channel_);
       if (result != WorkerResult::done) break;
       result = channel_.send(message);
+      if (result == WorkerResult::done) result = channel_.receive(&answer, deadline_);
       if (result == WorkerResult::closed) worker_.giveUp(&channel_);
     }
-    if (result == WorkerResult::done) result = channel_.receive(&message, deadline_);
     if (result == WorkerResult::done) {
-      if (const auto outcome = stores::decodeContactsOutcome(message)) return *outcome;
+      if (const auto outcome = stores::decodeContactsOutcome(answer)) return *outcome;
+      channel_.discard(&answer);
       result = WorkerResult::malformed;
     }
     if (result == WorkerResult::outOfMemory) {
-      worker_.giveUp(&channel_);
+      channel_.close();
       return stores::ContactsOutcome::outOfMemory;
     }
     failWith(result);
@@ -58,6 +60,7 @@ class RemoteManager final : public ContactsChannelManager {
             if (answer->error) *error = std::move(answer->error);
             return answer->done;
           }
+          channel_.discard(&message);
           result = WorkerResult::malformed;
         }
         failWith(result);
@@ -65,7 +68,7 @@ class RemoteManager final : public ContactsChannelManager {
       *error = failure_;
     } catch (const std::bad_alloc&) {
       // The error stays absent: it needs memory, too. What the worker still says answers nothing any more.
-      worker_.giveUp(&channel_);
+      channel_.close();
       failure_ = "out of memory";
     }
     return false;
@@ -73,7 +76,11 @@ class RemoteManager final : public ContactsChannelManager {
 
  private:
   void failWith(WorkerResult result) noexcept {
-    worker_.giveUp(&channel_);
+    // A lack of memory is this process's own.
+    if (result == WorkerResult::outOfMemory)
+      channel_.close();
+    else
+      worker_.giveUp(&channel_);
     switch (result) {
       case WorkerResult::timedOut:
         failure_ = "the contacts did not answer in time";

@@ -43,6 +43,10 @@ WorkerResult RemoteVoicemailStore::send(const VoicemailRequest& request, const S
       }
       return sent;
     }
+    if (sent == WorkerResult::outOfMemory) {
+      channel_.close();
+      return sent;
+    }
     worker_.giveUp(&channel_);
     if (sent != WorkerResult::closed || attempt > 0) return sent;
   }
@@ -64,6 +68,7 @@ RemoteVoicemailStore::Result RemoteVoicemailStore::exchange(VoicemailRequest* re
     case StoreFolder::State::outOfMemory:
       return Result::outOfMemory;
   }
+  bool isRepeated = false;
   for (;;) {
     request->serial = ++serial_;
     const WorkerResult sent = send(*request, folder);
@@ -71,11 +76,19 @@ RemoteVoicemailStore::Result RemoteVoicemailStore::exchange(VoicemailRequest* re
       return sent == WorkerResult::outOfMemory ? Result::outOfMemory : Result::failed;
     WorkerMessage message;
     const WorkerResult received = channel_.receive(&message, deadline);
+    if (received == WorkerResult::outOfMemory) {
+      channel_.close();
+      return Result::outOfMemory;
+    }
     auto decoded = received == WorkerResult::done ? stores::decodeVoicemailAnswer(message) : std::nullopt;
     if (!decoded || decoded->serial != request->serial) {
+      channel_.discard(&message);
+      const bool hasDied = received == WorkerResult::closed;
       // Of an answer that comes later nobody would know what it answers.
       worker_.giveUp(&channel_);
-      return received == WorkerResult::outOfMemory ? Result::outOfMemory : Result::failed;
+      // Whatever it was ended by; each operation is the same when it is done twice.
+      if (hasDied && !std::exchange(isRepeated, true)) continue;
+      return Result::failed;
     }
     if (decoded->outcome == VoicemailOutcome::notAllowed) {
       if (request->insists) return Result::failed;
@@ -103,8 +116,8 @@ bool RemoteVoicemailStore::perform(Operation operation, const std::string* key, 
     isToldByWorker = result == Result::outOfMemory && answer.outcome == VoicemailOutcome::outOfMemory;
     if (found != nullptr) *found = std::move(answer.token);
   } catch (const std::bad_alloc&) {
-    // What the worker says now would be taken for the next answer.
-    worker_.giveUp(&channel_);
+    // What the worker says now answers nothing any more. The lack is this process's own.
+    channel_.close();
   }
   if (result != Result::done && !isToldByWorker) {
     if (stores::writes(operation))

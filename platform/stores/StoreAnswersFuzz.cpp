@@ -62,7 +62,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   --size;
   std::vector<WorkerMessage> answers;
   for (int i = 0; i <= (how & 3) && size >= 6; ++i) {
-    const std::size_t length = std::min<std::size_t>(data[0] | data[1] << 8, size - 6);
+    const std::size_t length = std::min<std::size_t>(data[0] + 256U * data[1], size - 6);
     WorkerMessage& answer = answers.emplace_back();
     answer.kind = data[2] | static_cast<std::uint32_t>(data[3]) << 8 |
                   static_cast<std::uint32_t>(data[4]) << 16 | static_cast<std::uint32_t>(data[5]) << 24;

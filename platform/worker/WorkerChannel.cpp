@@ -12,7 +12,10 @@
 #include <climits>
 #include <cstring>
 #include <new>
+#include <span>
 #include <utility>
+
+#include "platform/ipc/linux/ClosingLine.h"
 
 namespace brenvik {
 namespace {
@@ -38,13 +41,60 @@ WorkerResult waitForMessage(int fd, Clock::time_point deadline) noexcept {
   }
 }
 
+// See docs/decisions/11-door.md. Never destroyed: a thread of it may be stuck at the end of the process.
+void closeElsewhere(UniqueFd descriptor) noexcept {
+  try {
+    static ClosingLine* const line = new ClosingLine;
+    line->close(std::move(descriptor), ClosingLine::kClients);
+  } catch (const std::bad_alloc&) {  // then here
+  }
+}
+
+// Whether nothing lies unread in a socket that nobody can fill any more.
+bool isEmpty(int socket) noexcept {
+  // Each message has its sender's credentials now, for which there is no room: an empty one can be told from
+  // none.
+  const int on = 1;
+  if (::setsockopt(socket, SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0) return false;
+  char byte = 0;
+  iovec io{&byte, 1};
+  msghdr message{};
+  message.msg_iov = &io;
+  message.msg_iovlen = 1;
+  return ::recvmsg(socket, &message, MSG_PEEK | MSG_DONTWAIT) == 0 && (message.msg_flags & MSG_CTRUNC) == 0;
+}
+
 }  // namespace
+
+WorkerChannel& WorkerChannel::operator=(WorkerChannel&& other) noexcept {
+  close();
+  socket_ = std::move(other.socket_);
+  generation_ = other.generation_;
+  isDistrusted_ = other.isDistrusted_;
+  return *this;
+}
+
+void WorkerChannel::close() noexcept {
+  if (!socket_.isValid()) return;
+  if (isDistrusted_) {
+    (void)::shutdown(socket_.get(), SHUT_RDWR);
+    if (!isEmpty(socket_.get())) closeElsewhere(std::move(socket_));
+  }
+  socket_.reset();
+}
+
+void WorkerChannel::discard(WorkerMessage* message) noexcept {
+  for (UniqueFd& each : message->descriptors) {
+    if (isDistrusted_) closeElsewhere(std::move(each));
+  }
+  message->descriptors.clear();
+}
 
 WorkerResult WorkerChannel::makePair(WorkerChannel* one, WorkerChannel* other) noexcept {
   int ends[2];
   if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0) return WorkerResult::outOfMemory;
-  one->socket_.reset(ends[0]);
-  other->socket_.reset(ends[1]);
+  *one = WorkerChannel(UniqueFd(ends[0]));
+  *other = WorkerChannel(UniqueFd(ends[1]));
   return WorkerResult::done;
 }
 
@@ -137,6 +187,16 @@ WorkerResult WorkerChannel::receive(WorkerMessage* message, Clock::time_point de
       received[count++].reset(fd);
     }
   }
+  // Of what is not handed over.
+  struct Dropped {
+    std::span<UniqueFd> all;
+    bool isDistrusted;
+    ~Dropped() {
+      for (UniqueFd& each : all) {
+        if (isDistrusted && each.isValid()) closeElsewhere(std::move(each));
+      }
+    }
+  } const dropped{std::span(received).first(count), isDistrusted_};
   if (size == 0) return WorkerResult::closed;
   // There was room for all: what the kernel had to leave out found no free descriptor in this process.
   if ((in.msg_flags & MSG_CTRUNC) != 0 && count <= WorkerMessage::kMostDescriptors)

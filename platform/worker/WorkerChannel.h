@@ -11,12 +11,15 @@
 
 namespace brenvik {
 
-// One end of a pair of connected AF_UNIX SOCK_SEQPACKET sockets. Closing it hangs up, also for whatever the
-// other end has not read yet. Each object belongs to one thread at a time.
+// One end of a pair of connected AF_UNIX SOCK_SEQPACKET sockets. Closing it hangs up; what the other end has
+// not read yet it still can. Each object belongs to one thread at a time.
 class WorkerChannel {
  public:
   // No channel: sending and receiving say `closed`.
   WorkerChannel() = default;
+  WorkerChannel(WorkerChannel&&) noexcept = default;
+  WorkerChannel& operator=(WorkerChannel&& other) noexcept;
+  ~WorkerChannel() { close(); }
   explicit WorkerChannel(UniqueFd socket) noexcept : socket_(std::move(socket)) {}
 
   // Two ends that are connected to each other, closed on exec(2). `outOfMemory` when there are no
@@ -33,7 +36,12 @@ class WorkerChannel {
   // For an event loop: readable when receive() would not wait.
   int descriptor() const noexcept { return socket_.get(); }
   bool isOpen() const noexcept { return socket_.isValid(); }
-  void close() noexcept { socket_.reset(); }
+  void close() noexcept;
+  // The other end may be hostile: what it sends are perhaps descriptors whose last close waits for as long as
+  // it likes. Those that arrive unread, or with what is no message, are closed on another thread.
+  void distrust() noexcept { isDistrusted_ = true; }
+  // Does the same with what came along with a message and was not asked for.
+  void discard(WorkerMessage* message) noexcept;
   // Gives the socket away.
   UniqueFd release() noexcept { return std::move(socket_); }
 
@@ -44,6 +52,7 @@ class WorkerChannel {
  private:
   UniqueFd socket_;
   std::uint64_t generation_ = 0;
+  bool isDistrusted_ = false;
 };
 
 // Whether a descriptor is a connected socket of a channel's kind.

@@ -4,6 +4,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <netinet/in.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -153,6 +154,79 @@ TEST_F(WorkerChannelTest, WithoutDescriptorsTheyAreALackOfThisProcess) {
   EXPECT_EQ(result, WorkerResult::outOfMemory);
   EXPECT_EQ(pair, WorkerResult::outOfMemory);
 }
+
+// A socket whose last close waits for two seconds: its peer takes nothing, and it is to linger.
+class LingeringSocket {
+ public:
+  LingeringSocket() {
+    const UniqueFd listening(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    socklen_t size = sizeof address;
+    auto* const where = reinterpret_cast<sockaddr*>(&address);
+    EXPECT_EQ(::bind(listening.get(), where, size), 0);
+    EXPECT_EQ(::listen(listening.get(), 1), 0);
+    EXPECT_EQ(::getsockname(listening.get(), where, &size), 0);
+    socket.reset(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    EXPECT_EQ(::connect(socket.get(), where, size), 0);
+    peer.reset(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC));
+    const std::vector<char> much(1 << 20);
+    while (::send(socket.get(), much.data(), much.size(), MSG_DONTWAIT) > 0) {
+    }
+    const linger on{1, 2};
+    EXPECT_EQ(::setsockopt(socket.get(), SOL_SOCKET, SO_LINGER, &on, sizeof on), 0);
+  }
+  UniqueFd socket;
+  UniqueFd peer;
+};
+
+// What a hostile peer sends: each leaves the descriptor to be closed by the receiver in another way.
+class DistrustedChannelTest : public WorkerChannelTest, public testing::WithParamInterface<int> {};
+
+TEST_P(DistrustedChannelTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
+  LingeringSocket lingering;
+  other.distrust();
+  WorkerMessage sent;
+  sent.descriptors.push_back(std::move(lingering.socket));
+  if (GetParam() == 0) {  // unread, behind an empty datagram
+    ASSERT_EQ(::send(one.descriptor(), "", 0, 0), 0);
+  }
+  ASSERT_EQ(one.send(sent), WorkerResult::done);
+  if (GetParam() == 1) {  // with what is no message
+    WorkerMessage more;
+    more.payload.resize(1);
+    const int fd = sent.descriptors[0].get();
+    (void)receiveNow(other);
+    other.discard(&message);
+    char byte = 0;
+    iovec io{&byte, 1};
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof fd)] = {};
+    msghdr out{};
+    out.msg_iov = &io;
+    out.msg_iovlen = 1;
+    out.msg_control = control;
+    out.msg_controllen = sizeof control;
+    cmsghdr* const item = CMSG_FIRSTHDR(&out);
+    item->cmsg_level = SOL_SOCKET;
+    item->cmsg_type = SCM_RIGHTS;
+    item->cmsg_len = CMSG_LEN(sizeof fd);
+    std::memcpy(CMSG_DATA(item), &fd, sizeof fd);
+    ASSERT_EQ(::sendmsg(one.descriptor(), &out, 0), 1);
+  }
+  sent.descriptors[0].reset();  // the last one is on its way now
+  const auto before = Clock::now();
+  if (GetParam() == 1) {
+    EXPECT_EQ(receiveNow(other), WorkerResult::malformed);
+  } else if (GetParam() == 2) {  // with a message that nobody asked for
+    EXPECT_EQ(receiveNow(other), WorkerResult::done);
+    other.discard(&message);
+  }
+  other.close();
+  EXPECT_LT(Clock::now() - before, 1s);
+}
+
+INSTANTIATE_TEST_SUITE_P(Ways, DistrustedChannelTest, testing::Values(0, 1, 2));
 
 TEST(ThreadedWorkerTest, ChannelsAreServedAndHangUpWithTheWorker) {
   ThreadedWorker worker([](std::uint32_t work, WorkerChannel channel) {

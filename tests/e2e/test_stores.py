@@ -5,14 +5,16 @@ import contextlib
 import os
 import pathlib
 import pwd
+import shutil
 import signal
+import socket
 import sqlite3
 import struct
 import subprocess
 import time
 
 import wire
-from harness import ERROR, HelperTest, as_account, eventually, main
+from harness import BUILD, ERROR, HelperTest, as_account, eventually, listen, main
 
 HOME = pathlib.Path("/var/mobile")
 LIBRARY = HOME / "Library"
@@ -298,6 +300,7 @@ class Worker(StoresTest):
         for name in ("CapInh", "CapPrm", "CapEff", "CapAmb"):
             self.assertEqual(int(status[name], 16), 0, name)
         self.assertEqual(status["NoNewPrivs"], "1")
+        self.assertEqual(status["Seccomp"], "2", "it opens no network socket")
         self.assertEqual(pathlib.Path(f"/proc/{worker}/environ").read_bytes(), b"")
         # Its own account's processes cannot look into it, nor at what it was handed.
         self.assertEqual(as_account("mobile", lambda: int(os.access(f"/proc/{worker}/mem", os.R_OK))), 0)
@@ -363,6 +366,68 @@ class Worker(StoresTest):
             self.assertEqual(self.token(), "token")
         self.logs.wait_for("unified", ERROR, f"{WORKER} does not answer as it should, and is ended")
         self.logs.wait_for("unified", ERROR, READ)
+
+
+class Service(StoresTest):
+    """The worker as a service of its own: the service manager holds its socket and starts it as the account."""
+
+    NAME = "com.norvale.brenvik.mobile-helper.stores"
+
+    def prepare(self):
+        # Where the account can get at it, as it can where the program is installed.
+        self.program = pathlib.Path("/tmp") / WORKER
+        shutil.copy(BUILD / WORKER, self.program)
+        self.listening = listen(f"/run/brenvik/bootstrap/{self.NAME}")
+        self.addCleanup(os.unlink, f"/run/brenvik/bootstrap/{self.NAME}")
+        self.addCleanup(self.listening.close)
+        self.start()
+
+    def start(self):
+        command = ["/bin/sh", "-c", f'exec 3<&{self.listening.fileno()}; LISTEN_PID=$$ exec "$@"', "sh", str(self.program)]
+        self.worker = subprocess.Popen(command, env={"LISTEN_FDS": "1", "LISTEN_FDNAMES": self.NAME},
+                                       pass_fds=[self.listening.fileno()], user=MOBILE.pw_uid, group=MOBILE.pw_gid,
+                                       extra_groups=[])
+        self.addCleanup(self.worker.wait)
+        self.addCleanup(self.worker.kill)
+
+    def test_it_serves_the_helper_which_starts_none_and_leaves_with_it(self):
+        self.make_contacts()
+        self.set_token()
+        self.assertEqual(self.token(), "token")
+        self.assertEqual(self.remap(), 1)
+        self.assertEqual(self.workers(), [])
+        self.assertIsNone(self.worker.poll())
+        os.kill(self.daemon.pid, signal.SIGKILL)
+        self.daemon.wait()
+        self.assertEqual(self.worker.wait(10), 0)
+
+    def test_while_none_is_started_an_operation_fails_in_time_and_the_next_one_has_the_new_one(self):
+        self.set_token()
+        self.worker.kill()
+        self.worker.wait()
+        with self.within(3):
+            self.assertEqual(self.token(), "")
+        self.start()
+        self.assertEqual(self.token(), "token")
+
+    def test_nobody_but_root_is_served(self):
+        os.chmod(f"/run/brenvik/bootstrap/{self.NAME}", 0o666)
+
+        def ask():
+            with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as stranger:
+                stranger.settimeout(10)
+                stranger.connect(f"/run/brenvik/bootstrap/{self.NAME}")
+                return len(stranger.recv(10))
+        self.assertEqual(as_account("mobile", ask), 0)
+        self.assertEqual(self.worker.wait(10), 0, "with nobody else to serve it leaves")
+        self.start()
+        self.set_token()
+        self.assertEqual(self.token(), "token")
+
+    def test_started_by_anybody_else_it_does_nothing(self):
+        done = subprocess.run([BUILD / WORKER], stdin=subprocess.DEVNULL, capture_output=True, timeout=10, check=False)
+        self.assertEqual(done.returncode, 1)
+        self.logs.wait_for("unified", ERROR, f"{self.NAME} is a service for the helper, which starts it")
 
 
 if __name__ == "__main__":

@@ -44,7 +44,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   WorkerChannel theirs;
   require(WorkerChannel::makePair(&ours, &theirs) == WorkerResult::done);
   for (int i = 0; i < 16 && size >= 6; ++i) {
-    const std::size_t length = std::min<std::size_t>(data[0] | data[1] << 8, size - 6);
+    const std::size_t length = std::min<std::size_t>(data[0] + 256U * data[1], size - 6);
     WorkerMessage message;
     message.kind = data[2] | static_cast<std::uint32_t>(data[3]) << 8 |
                    static_cast<std::uint32_t>(data[4]) << 16 | static_cast<std::uint32_t>(data[5]) << 24;
@@ -57,6 +57,6 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     size -= 6 + length;
   }
   ours.close();  // what was sent is read, then the end of it
-  serveStore(how & 3, std::move(theirs));
+  serveStore(how & 3U, std::move(theirs));
   return 0;
 }

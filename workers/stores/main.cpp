@@ -50,10 +50,12 @@ int main() {
   brenvik::setLogSink(&log);
   // Nothing it is asked goes without: the first request finds the library there.
   (void)brenvik::sqlite();
-  const int status = brenvik::WorkerHost::run(
-      {.service = brenvik::stores::kService,
-       .rights = {.accounts = {"mobile"}, .keptCapabilities = {}, .addressSpace = rlim_t{1} << 30}},
-      brenvik::serveOnItsOwnThread);
+  const int status = brenvik::WorkerHost::run({.service = brenvik::stores::kService,
+                                               .rights = {.accounts = {"mobile"},
+                                                          .keptCapabilities = {},
+                                                          .isLocalOnly = true,
+                                                          .addressSpace = rlim_t{1} << 30}},
+                                              brenvik::serveOnItsOwnThread);
   // Work that hangs in somebody's file system must not keep the process.
   ::_exit(status);
 }

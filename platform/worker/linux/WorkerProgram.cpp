@@ -88,6 +88,7 @@ WorkerResult WorkerProgram::open(std::uint32_t work, WorkerChannel* channel) noe
       const WorkerResult sent = connection_.send(message);
       if (sent == WorkerResult::done) {
         ours.setGeneration(generation_);
+        ours.distrust();
         *channel = std::move(ours);
         return WorkerResult::done;
       }

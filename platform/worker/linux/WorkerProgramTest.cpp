@@ -4,11 +4,13 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sched.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <csignal>
 #include <cstring>
 #include <filesystem>
@@ -32,6 +34,15 @@ using namespace std::chrono_literals;
 using Clock = std::chrono::steady_clock;
 
 constexpr const char* kService = "org.test.worker";
+
+// Not in a user namespace that knows one only.
+bool hasManyAccounts() {
+  std::ifstream map("/proc/self/uid_map");
+  std::uint64_t inside = 0;
+  std::uint64_t outside = 0;
+  std::uint64_t count = 0;
+  return static_cast<bool>(map >> inside >> outside >> count) && inside == 0 && count > 65534;
+}
 
 std::vector<pid_t> children() {
   std::vector<pid_t> found;
@@ -120,14 +131,20 @@ TEST_F(WorkerProgramTest, AWorkerHasNothingButWhatItWasGiven) {
   const std::uint32_t descriptors = reader.u32();
   const std::uint32_t variables = reader.u32();
   const std::uint64_t limit = reader.u64();
+  const int internet = static_cast<int>(reader.u32());
+  const int netlink = static_cast<int>(reader.u32());
+  const int local = static_cast<int>(reader.u32());
   ASSERT_TRUE(reader.whole());
   EXPECT_EQ(capabilities, "0000000000000000");
   EXPECT_EQ(noNewPrivileges, "1");
   EXPECT_EQ(variables, 0U);
   EXPECT_EQ(limit, 256U);
+  EXPECT_EQ(internet, EAFNOSUPPORT);
+  EXPECT_EQ(netlink, EAFNOSUPPORT);
+  EXPECT_EQ(local, 0);
   // Three standard ones, the connection, this channel, and the journal's socket if it has one.
   EXPECT_LE(descriptors, 6U);
-  if (::geteuid() == 0) {
+  if (::geteuid() == 0 && hasManyAccounts()) {
     EXPECT_EQ(uid, 65534U);
     EXPECT_EQ(gid, 65534U);
     EXPECT_EQ(groups, "");
@@ -135,6 +152,32 @@ TEST_F(WorkerProgramTest, AWorkerHasNothingButWhatItWasGiven) {
     EXPECT_EQ(uid, ::getuid());
   }
   ::unsetenv("BRENVIK_LEAK");
+}
+
+TEST_F(WorkerProgramTest, InANamespaceWithOneAccountThatStaysWithoutACapability) {
+  const uid_t uid = ::geteuid();
+  const gid_t gid = ::getegid();
+  const pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    if (::unshare(CLONE_NEWUSER) != 0) ::_exit(77);
+    std::ofstream("/proc/self/setgroups") << "deny";
+    std::ofstream("/proc/self/uid_map") << "0 " << uid << " 1";
+    std::ofstream("/proc/self/gid_map") << "0 " << gid << " 1";
+    WorkerProgram worker(description());
+    WorkerChannel channel;
+    if (open(worker, WorkForTests::report, &channel) != WorkerResult::done) ::_exit(2);
+    if (receive(channel) != WorkerResult::done) ::_exit(3);
+    FieldReader reader(message.payload);
+    const bool keptAccount = reader.u32() == 0 && reader.u32() == 0;
+    (void)reader.text();
+    const bool hasNothing = reader.text() == "0000000000000000";
+    ::_exit(keptAccount && hasNothing ? 0 : 4);
+  }
+  int status = -1;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  if (WIFEXITED(status) && WEXITSTATUS(status) == 77) GTEST_SKIP() << "no user namespaces to be had";
+  EXPECT_EQ(status, 0);
 }
 
 TEST_F(WorkerProgramTest, DeathHangsUpAllChannelsAndTheNextOneHasANewWorker) {

@@ -20,6 +20,9 @@ struct WorkerRights {
   // Capabilities (capabilities(7)) that it keeps when root started it and its group is this one. None: no
   // capability.
   std::function<std::vector<int>(gid_t)> keptCapabilities;
+  // It opens no socket but local ones, starts no program and looks into no other process: a filter of system
+  // calls (seccomp(2)) refuses that. On machines that the filter does not know it is left out.
+  bool isLocalOnly = false;
   rlim_t descriptors = 256;
   // Bytes of address space; 0: no limit. Not with sanitizers, whose shadow memory is larger than any limit.
   rlim_t addressSpace = 0;

@@ -3,8 +3,10 @@
 // A worker for tests. What it does with a channel is the sort of work; each runs on a thread of its own.
 #include <fcntl.h>
 #include <sys/resource.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <fstream>
 #include <string>
 #include <thread>
@@ -39,6 +41,12 @@ std::uint32_t openDescriptors() {
   return count;
 }
 
+// 0: there is such a socket.
+std::uint32_t socketError(int family) {
+  const UniqueFd socket(::socket(family, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+  return socket.isValid() ? 0 : static_cast<std::uint32_t>(errno);
+}
+
 void report(WorkerChannel& channel) {
   rlimit descriptors{};
   (void)::getrlimit(RLIMIT_NOFILE, &descriptors);
@@ -54,6 +62,9 @@ void report(WorkerChannel& channel) {
                         .u32(openDescriptors())
                         .u32(variables)
                         .u64(descriptors.rlim_max)
+                        .u32(socketError(AF_INET))
+                        .u32(socketError(AF_NETLINK))
+                        .u32(socketError(AF_UNIX))
                         .take();
   (void)channel.send(message);
 }
@@ -97,7 +108,8 @@ int main() {
   brenvik::SystemLog log("worker-for-tests");
   brenvik::setLogSink(&log);
   const int status = brenvik::WorkerHost::run(
-      {.service = "org.test.worker", .rights = {.accounts = {}, .otherwise = 65534, .keptCapabilities = {}}},
+      {.service = "org.test.worker",
+       .rights = {.accounts = {}, .otherwise = 65534, .keptCapabilities = {}, .isLocalOnly = true}},
       [](std::uint32_t kind, brenvik::WorkerChannel channel) {
         std::thread(brenvik::work, kind, std::move(channel)).detach();
       });
