@@ -3,6 +3,7 @@
 #include "platform/web/WebBody.h"
 
 #include <sys/mman.h>
+#include <sys/uio.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -29,13 +30,19 @@ std::byte* map(std::size_t capacity) {
   return static_cast<std::byte*>(made);
 }
 
-void writeAll(int memory, std::span<const std::byte> bytes) {
-  while (!bytes.empty()) {
-    const auto written = ::write(memory, bytes.data(), bytes.size());
-    if (written < 0 && errno == EINTR) continue;
-    if (written <= 0) throw std::bad_alloc();
-    bytes = bytes.subspan(static_cast<std::size_t>(written));
-  }
+// Of memory that is written like a file. A page that one write fills whole need not be cleared first, and
+// pieces come in no multiple of it.
+constexpr std::size_t kPage = 4096;
+
+// Memory takes all of it or has run out.
+bool writeBoth(int memory, std::span<const std::byte> first, std::span<const std::byte> second) noexcept {
+  const iovec pieces[] = {{const_cast<std::byte*>(first.data()), first.size()},
+                          {const_cast<std::byte*>(second.data()), second.size()}};
+  ssize_t written = -1;
+  do {
+    written = ::writev(memory, pieces, 2);
+  } while (written < 0 && errno == EINTR);
+  return written >= 0 && static_cast<std::size_t>(written) == first.size() + second.size();
 }
 
 }  // namespace
@@ -50,8 +57,10 @@ WebBody WebBody::forAnotherProcess() {
 
 UniqueFd WebBody::takeSealed() noexcept {
   WebBody body = std::move(*this);
-  size_ = 0;
-  if (body.form_ != Form::forAnotherProcess || !sealAgainstChange(body.memory_.get())) return {};
+  if (body.form_ != Form::forAnotherProcess || !writeBoth(body.memory_.get(), body.tail_, {}) ||
+      !sealAgainstChange(body.memory_.get())) {
+    return {};
+  }
   return std::move(body.memory_);
 }
 
@@ -73,6 +82,7 @@ void WebBody::clear() noexcept {
   // The next bytes go to the beginning. It was written there before, so cutting it off does not fail.
   if (form_ == Form::forAnotherProcess && size_ > 0)
     (void)!(::ftruncate(memory_.get(), 0) == 0 && ::lseek(memory_.get(), 0, SEEK_SET) == 0);
+  tail_.clear();
   size_ = 0;
 }
 
@@ -121,7 +131,16 @@ void WebBody::append(std::span<const std::byte> bytes) {
   if (bytes.empty()) return;
   if (form_ == Form::sealed) reserve(0);
   if (form_ == Form::forAnotherProcess) {
-    writeAll(memory_.get(), bytes);
+    const std::size_t whole = (tail_.size() + bytes.size()) / kPage * kPage;
+    tail_.reserve(kPage);
+    if (whole > 0) {
+      const auto now = bytes.first(whole - tail_.size());
+      if (!writeBoth(memory_.get(), tail_, now)) throw std::bad_alloc();
+      size_ += now.size();
+      tail_.clear();
+      bytes = bytes.subspan(now.size());
+    }
+    tail_.insert(tail_.end(), bytes.begin(), bytes.end());
     size_ += bytes.size();
     return;
   }

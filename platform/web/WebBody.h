@@ -7,6 +7,7 @@
 #include <optional>
 #include <span>
 #include <utility>
+#include <vector>
 
 #include "platform/base/UniqueFd.h"
 
@@ -24,12 +25,14 @@ class WebBody {
         size_(std::exchange(other.size_, 0)),
         capacity_(std::exchange(other.capacity_, 0)),
         memory_(std::move(other.memory_)),
+        tail_(std::move(other.tail_)),
         form_(std::exchange(other.form_, Form::own)) {}
   WebBody& operator=(WebBody other) noexcept {
     std::swap(data_, other.data_);
     std::swap(size_, other.size_);
     std::swap(capacity_, other.capacity_);
     std::swap(memory_, other.memory_);
+    std::swap(tail_, other.tail_);
     std::swap(form_, other.form_);
     return *this;
   }
@@ -68,6 +71,8 @@ class WebBody {
   std::size_t size_ = 0;
   std::size_t capacity_ = 0;  // a whole number of kLargeUnit: mapped; else from the heap. 0 when sealed
   UniqueFd memory_;
+  std::vector<std::byte>
+      tail_;  // of a body for another process: the last bytes, which do not fill a page yet
   Form form_ = Form::own;
 };
 

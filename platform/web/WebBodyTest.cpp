@@ -3,6 +3,8 @@
 #include "platform/web/WebBody.h"
 
 #include <gtest/gtest.h>
+#include <sys/mman.h>
+#include <unistd.h>
 
 #include <limits>
 #include <string>
@@ -67,6 +69,57 @@ TEST(WebBodyTest, ACopyIsItsOwnAndAMoveLeavesNothing) {
     copy = WebBody();
     EXPECT_TRUE(copy.empty());
   }
+}
+
+TEST(WebBodyTest, ABodyForAnotherProcessArrivesThereAsItWasWritten) {
+  WebBody made = WebBody::forAnotherProcess();
+  made.append(bytesOf("of an attempt that came to nothing"));
+  made.clear();
+  made.append(bytesOf("first "));
+  made.reserve(5'000'000);
+  const std::string rest(5'000'000, 'r');
+  made.append(bytesOf(rest));
+  EXPECT_EQ(made.size(), 6 + rest.size());
+  EXPECT_TRUE(std::span<const std::byte>(made).empty()) << "nobody reads it here";
+  WebBody moved = std::move(made);
+  UniqueFd memory = moved.takeSealed();
+  ASSERT_TRUE(memory.isValid());
+  EXPECT_TRUE(moved.empty());
+  EXPECT_FALSE(moved.takeSealed().isValid()) << "once";
+  const auto arrived = WebBody::ofSealedMemory(std::move(memory), 6 + rest.size());
+  ASSERT_TRUE(arrived);
+  EXPECT_TRUE(textOf(*arrived) == "first " + rest);
+  EXPECT_GE(arrived->sealedMemory(), 0);
+}
+
+TEST(WebBodyTest, MemoryThatCanStillChangeOrIsOfAnotherSizeIsNoBody) {
+  const auto sealed = [] {
+    WebBody body = WebBody::forAnotherProcess();
+    body.append(bytesOf("four"));
+    return body.takeSealed();
+  };
+  EXPECT_TRUE(WebBody::ofSealedMemory(sealed(), 4));
+  EXPECT_FALSE(WebBody::ofSealedMemory(sealed(), 3));
+  EXPECT_FALSE(WebBody::ofSealedMemory(sealed(), 5));
+  EXPECT_FALSE(WebBody::ofSealedMemory(sealed(), 0));
+  EXPECT_FALSE(WebBody::ofSealedMemory(UniqueFd(), 4));
+  UniqueFd open(::memfd_create("open", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+  ASSERT_EQ(::write(open.get(), "four", 4), 4);
+  EXPECT_FALSE(WebBody::ofSealedMemory(std::move(open), 4));
+}
+
+TEST(WebBodyTest, ABodyOfAnotherProcessBecomesOnesOwnWhenItIsCopiedOrAddedTo) {
+  WebBody made = WebBody::forAnotherProcess();
+  made.append(bytesOf("theirs"));
+  auto body = WebBody::ofSealedMemory(made.takeSealed(), 6).value();
+  const WebBody copy = body;
+  EXPECT_EQ(textOf(copy), "theirs");
+  EXPECT_EQ(copy.sealedMemory(), -1);
+  body.append(bytesOf(" and ours"));
+  EXPECT_EQ(textOf(body), "theirs and ours");
+  EXPECT_EQ(body.sealedMemory(), -1);
+  body.clear();
+  EXPECT_TRUE(body.empty());
 }
 
 TEST(WebBodyTest, MoreThanThereIsThrowsAndChangesNothing) {

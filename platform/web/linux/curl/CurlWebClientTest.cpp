@@ -717,6 +717,45 @@ TEST_F(CurlWebClientTest, WhatIsUnderWayWhenTheClientIsDestroyedCompletesAsCance
   expectKind(WebErrorKind::cancelled, lateAnswer.get_future().get());
 }
 
+TEST_F(CurlWebClientTest, ARequestThatIsCancelledCompletesAndOthersGoOn) {
+  std::promise<void> reached;
+  HttpsServer server(identity, [&](Connection& connection) {
+    if (connection.readRequest().starts_with("GET /other ")) return connection.respond("200 OK", "other");
+    reached.set_value();
+    connection.stall();
+  });
+  makeClient();
+  std::promise<std::shared_ptr<WebResponse>> answer;
+  const auto request = client->makeRequest(WebRequestType::get, server.url(), {}, client->makeSession());
+  request->setCallbackQueue(callbackQueue);
+  request->setCompletion(
+      [&](std::shared_ptr<WebResponse> response) { answer.set_value(std::move(response)); });
+  request->cancel();  // to no effect: it has not been sent
+  request->send({});
+  reached.get_future().wait();
+  request->cancel();
+  expectKind(WebErrorKind::cancelled, answer.get_future().get());
+  EXPECT_EQ(textOf(*fetch(server.url("/other"))), "other");
+  request->cancel();  // to no effect: it has completed
+  EXPECT_EQ(textOf(*fetch(server.url("/other"))), "other");
+}
+
+TEST_F(CurlWebClientTest, BodiesForAnotherProcessAreWrittenIntoMemoryThatCanBeSealed) {
+  const std::string body(3'000'000, 'b');
+  HttpsServer server(identity, [&](Connection& connection) {
+    if (connection.readRequest().starts_with("GET /moved "))
+      return connection.respond("302 Found\r\nLocation: /here", "a body that nobody reads");
+    connection.respond("200 OK", body);
+  });
+  settings.bodiesForAnotherProcess = true;
+  const auto response = fetch(server.url("/moved"));
+  expectKind(WebErrorKind::none, response);
+  ASSERT_EQ(response->body.size(), body.size());
+  const auto read = WebBody::ofSealedMemory(response->body.takeSealed(), body.size());
+  ASSERT_TRUE(read);
+  EXPECT_TRUE(std::string(reinterpret_cast<const char*>(read->data()), read->size()) == body);
+}
+
 TEST_F(CurlWebClientTest, WithoutDescriptorsOrTimersToWorkWithRequestsCompleteAndLaterOnesWork) {
   HttpsServer server(identity, [](Connection& connection) {
     connection.readRequest();
