@@ -121,7 +121,7 @@ class FileSystemManager::Merge final : public ItemVisitor {
     bool fromIsDirectory = false;
     bool toIsDirectory = false;
     const bool bothExist =
-        owner_.files().itemExists(from, &fromIsDirectory) && owner_.files().itemExists(to, &toIsDirectory);
+        owner_.files().itemExists(to, &toIsDirectory) && owner_.files().itemExists(from, &fromIsDirectory);
     std::string parent = directoryNameOf(to);
     if (parent != lastParent_) {
       (void)owner_.createDirectory(parent, kDirectoryMode, true);  // without it the transfer fails by itself

@@ -47,10 +47,11 @@ struct DirectoryAttributes {
   std::string_view groupName;
 };
 
+// The owner of a link is its own, never that of what it points to. Other accounts' links do not become root's
+// or this account's; such a change counts as done.
 struct ItemAttributes {
   std::optional<mode_t> mode;  // links are passed over
-  std::optional<uid_t>
-      uid;  // of a link itself, never of what it points to; others' links do not become root's
+  std::optional<uid_t> uid;
   std::optional<gid_t> gid;
 };
 

@@ -71,15 +71,22 @@ class CheckingSink final : public ArchiveFrameSink {
   bool open_ = false;
 };
 
-int parse(std::string_view bytes, std::size_t piece) {
+enum class Data { taken, passed };  // passed: a file's data goes another way
+
+int parse(std::string_view bytes, std::size_t piece, Data data = Data::taken) {
   CheckingSink sink;
   ArchiveFrameParser parser(sink);
   int result = 0;
   while (!bytes.empty() && result == 0) {
     require(parser.bestPiece() > 0);
-    const std::string_view part = bytes.substr(0, piece);
+    const std::size_t ahead = data == Data::passed ? parser.dataAhead() : 0;
+    const std::string_view part = bytes.substr(0, ahead > 0 ? ahead : piece);
     bytes.remove_prefix(part.size());
-    result = parser.take(part);
+    if (ahead > 0) {
+      parser.pass(part.size());
+    } else {
+      result = parser.take(part);
+    }
   }
   return result != 0 ? result : parser.hasFinished() ? -1 : 0;
 }
@@ -93,6 +100,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   const int whole = brenvik::parse(bytes, size + 1);
   brenvik::require(brenvik::parse(bytes, 1) == whole);
   brenvik::require(brenvik::parse(bytes, 7) == whole);
+  brenvik::require(brenvik::parse(bytes, 1, brenvik::Data::passed) == whole);
   (void)brenvik::isCleanEntryPath(bytes);
   const std::string_view link = bytes.substr(0, size / 2);
   (void)brenvik::staysInside(link, bytes.substr(link.size()));

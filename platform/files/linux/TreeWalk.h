@@ -49,7 +49,10 @@ class TreeWalk {
   // The path of the entry visited, entered or left, below the top.
   const std::string& path() const { return path_; }
   // Its last part.
-  const char* name() const { return path_.c_str() + path_.rfind('/') + 1; }
+  const char* name() const {
+    const std::size_t slash = path_.rfind('/');
+    return path_.c_str() + (slash == std::string::npos ? 0 : slash + 1);
+  }
 
  private:
   int enter(Level level);
