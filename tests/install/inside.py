@@ -659,6 +659,23 @@ def a_store_worker_that_was_taken_over_is_held():
                  ("EACCES", "EACCES", "ENOENT", "EACCES"), "homes and packages")
 
 
+def serves_without_the_account_mobile():
+    """A machine without it: the packages' units are as they are, and the helper finds no home to look in."""
+    accounts = pathlib.Path("/etc/passwd")
+    before = accounts.read_text()
+    run("systemctl", "stop", SERVICE, "brenvik-store-worker.service")
+    try:
+        accounts.write_text("".join(line for line in before.splitlines(True) if not line.startswith("mobile:")))
+        bvhelperctl("ping")
+        expect_equal(bvhelperctl("voicemail", "token", check=False).stdout, "(no token)\n")
+        expect_equal(property_of("brenvik-store-worker.service", "ActiveState"), "inactive", "nobody asks for a worker")
+        run("systemctl", "restart", "brenvik-store-worker.socket")
+        workers_listen()
+    finally:
+        accounts.write_text(before)
+        run("systemctl", "stop", SERVICE)
+
+
 def only_root_reaches_a_worker():
     for path in WORKERS.values():
         done = run("setpriv", "--reuid=mobile", "--regid=mobile", "--groups", "brenvik", sys.executable, "-c",
@@ -965,7 +982,8 @@ def main():
              stores_no_preference_where_it_would_be_lost, works_for_the_whole_phone,
              asks_the_network, beats_over_the_cellular_link, held_in_its_sandbox,
              a_helper_that_was_taken_over_is_held, a_network_worker_that_was_taken_over_is_held,
-             a_store_worker_that_was_taken_over_is_held, only_root_reaches_a_worker,
+             a_store_worker_that_was_taken_over_is_held, serves_without_the_account_mobile,
+             only_root_reaches_a_worker,
              other_accounts_are_told_apart, the_handbook_is_whole, a_telephony_daemon_without_rights_lives_with_it,
              journal_explains, tells_what_keeps_it, leaves_when_idle_and_comes_back,
              a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade,

@@ -125,8 +125,6 @@ class InstalledTree(unittest.TestCase):
             unit = self.one(rf"lib/systemd/system/{name}\.service").read_text()
             program = re.search(r"^ExecStart=(\S+)$", unit, flags=re.M)[1]
             self.assertTrue((self.root / program[1:]).is_file(), program)
-            for folder in re.findall(r"^RootDirectory=(\S+)$", unit, flags=re.M):
-                self.assertTrue((self.root / folder[1:]).is_dir(), folder)
 
     def test_every_function_of_the_library_leads_to_its_page(self):
         if not self.pages:

@@ -116,7 +116,9 @@ class Units(unittest.TestCase):
         for path in set(self.values("BindPaths")) - {"/tmp"}:
             self.assertTrue(path.startswith("-"), f"it would not start without {path}")
             self.assertIn(path.lstrip("-"), made)
-        self.assertIn("systemd-tmpfiles-setup.service", self.values("After"))
+        for name in (SERVICE, STORES):
+            self.assertLessEqual(set(self.values("RootDirectory", name)), made)
+            self.assertIn("systemd-tmpfiles-setup.service", self.values("After", name))
         self.assertIn("/root/Library/Preferences", made)
 
     def test_servers_behind_every_kind_of_unicast_address_are_reachable(self):
