@@ -50,6 +50,7 @@ std::int32_t Client::connect() noexcept {
   if (channel_.isValid()) return BVMH_OK;
   const std::int32_t code = checkIn(Deadline::in(timeout_));
   wantsChannel_ = code == BVMH_OK;
+  wasConnected_ = wantsChannel_;
   rearm();
   return code;
 }

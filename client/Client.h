@@ -91,6 +91,7 @@ class Client {
   BegunCall* add(const RoutineFacts& routine, std::span<const std::byte> message, Regions regions,
                  void* context) noexcept;
   void settle() noexcept;  // all that needs no waiting
+  void startCheckIn() noexcept;
   void ensureChannel() noexcept;
   void checkInEnded(std::int32_t code) noexcept;
   void sendWaiting() noexcept;
