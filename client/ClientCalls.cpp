@@ -186,7 +186,8 @@ void Client::sendWaiting() noexcept {
     switch (
         sendMessage(channel_.get(), request.parts(), request.descriptors(), Deadline::never(), &waiting)) {
       case Io::done:
-        questions_.asked(call.routine->id, call.publicNumber(), now());
+        if (Questions::isQuestion(call.routine->id))
+          questions_.asked(call.routine->id, call.publicNumber(), now());
         calls_.markSent(place);
         break;
       case Io::timedOut:
