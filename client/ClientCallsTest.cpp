@@ -164,6 +164,7 @@ TEST_F(BegunCallsTest, NothingWaitsForAHelperThatDoesNotAnswer) {
   EXPECT_EQ(bvmh_take_result(client(), call, &result), BVMH_ERROR_IN_PROGRESS);
   EXPECT_FALSE(isReadable(client()));
   mayEnd = true;
+  helper_->finish();
 }
 
 TEST_F(BegunCallsTest, TheDescriptorIsReadableExactlyWhileThereIsSomethingToDo) {
@@ -846,6 +847,7 @@ TEST_F(InterruptTest, ManyFromManyThreadsHarmNothing) {
   isOver = true;
   bvmh_disconnect(client());
   (void)connectTo(helper_->path());  // should it wait for one more
+  helper_->finish();
 }
 
 }  // namespace
