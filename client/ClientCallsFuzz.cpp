@@ -80,6 +80,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   bvmh_client* const client = bvmh_client_create();
   require(client != nullptr && bvmh_client_set_socket(client, door.path.c_str()) == BVMH_OK);
   require(bvmh_client_fd(client) >= 0 && bvmh_begin_connect(client, nullptr, nullptr) == BVMH_OK);
+  require(bvmh_process(client) == BVMH_OK);
   UniqueFd channel = admit(door);
   require(bvmh_process(client) == BVMH_OK);
   // Two of each form of reply.
@@ -91,7 +92,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   }
   static constexpr std::array<std::byte, 64> kContent{};
   while (size >= 3) {
-    const std::size_t length = std::min<std::size_t>(data[0] | data[1] << 8, size - 3);
+    const std::size_t length = std::min(std::size_t{data[0]} | std::size_t{data[1]} << 8, size - 3);
     const unsigned extras = data[2];
     std::array<std::byte, 4096> datagram{};
     const std::size_t taken = std::min(length, datagram.size());
