@@ -267,7 +267,7 @@ def stun_server(seen_as):
 
 
 PACKAGES = ("brenvik-mobile-helper", "brenvik-mobile-helper-data", "bvhelperctl", "libbrenvik-mobile-helper0",
-            "libbrenvik-mobile-helper-dev")
+            "libbrenvik-mobile-helper-dev", "python3-brenvik-mobile-helper")
 # What is there before the packages come. What the package manager, accounts and the journal write is theirs.
 BEFORE = set()
 NOT_THE_PACKAGES_OWN = ("/proc", "/sys", "/dev", "/run", "/tmp", "/out", "/test", "/packages", "/var/lib/dpkg", "/var/log",
@@ -322,6 +322,24 @@ def served_with_one():
     run("cp", "/usr/share/doc/bvhelperctl/examples/50-bvhelperctl.plist", "/etc/brenvik/entitlements.d/")
     bvhelperctl("ping")
     expect_equal(property_of(SERVICE, "ActiveState"), "active", "started by the client")
+
+
+def python_works():
+    entitlement = pathlib.Path("/etc/brenvik/entitlements.d/70-python.plist")
+    entitlement.write_bytes(plistlib.dumps({"Executable": os.path.realpath(sys.executable), "Entitlements": {
+        "com.norvale.Teravox.BrenvikHelper.allow": True}}))
+    code = """from brenvik_mobile_helper import Client
+with Client() as helper:
+    helper.set_preference_value("com.example.install", "python", ["Grüße"])
+    print(helper.copy_preference_value("com.example.install", "python"))
+    helper.set_preference_value("com.example.install", "python", None)"""
+    expect_equal(run("/usr/bin/python3", "-c", code).stdout, "['Grüße']\n")
+    entitlement.unlink()
+    # The mock takes the helper's place for one command, and nobody else notices.
+    script = pathlib.Path("/tmp/answers.mock")
+    script.write_text('on CopyCountryCode\n  answer "QQ"\n')
+    expect_equal(run("brenvik-mobile-helper-mock", script, "--", "bvhelperctl", "location", "country").stdout, "QQ\n")
+    expect(bvhelperctl("location", "country", check=False).stdout != "QQ\n", "the real helper is where it was")
 
 
 def works_in_its_sandbox():
@@ -785,7 +803,7 @@ def purge():
 
 
 def main():
-    steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, works_in_its_sandbox,
+    steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, python_works, works_in_its_sandbox,
              stores_no_preference_where_it_would_be_lost, works_for_the_whole_phone,
              asks_the_network, beats_over_the_cellular_link, held_in_its_sandbox,
              other_accounts_are_told_apart, a_telephony_daemon_without_rights_lives_with_it, journal_explains, leaves_when_idle_and_comes_back,
