@@ -50,6 +50,7 @@ std::int32_t Client::connect() noexcept {
   if (channel_.isValid()) return BVMH_OK;
   const std::int32_t code = checkIn(Deadline::in(timeout_));
   wantsChannel_ = code == BVMH_OK;
+  wasConnected_ = wantsChannel_;
   rearm();
   return code;
 }
@@ -234,9 +235,10 @@ std::int32_t Client::call(const RoutineFacts& routine, std::span<std::byte> mess
     switch (outcome) {
       case Exchange::answered: {
         const std::int32_t code = reply.code == BVMH_OK ? readResult(routine, reply, result) : reply.code;
-        incoming_ = Incoming{};
+        if (incoming_.descriptorCount != 0) incoming_ = Incoming{};
         if (code == BVMH_ERROR_PROTOCOL) closeChannel();
-        if (code == BVMH_OK) questions_.asked(routine.id, 0, std::chrono::steady_clock::now());
+        if (code == BVMH_OK && Questions::isQuestion(routine.id))
+          questions_.asked(routine.id, 0, std::chrono::steady_clock::now());
         return code;
       }
       case Exchange::notTaken:

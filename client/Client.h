@@ -91,6 +91,7 @@ class Client {
   BegunCall* add(const RoutineFacts& routine, std::span<const std::byte> message, Regions regions,
                  void* context) noexcept;
   void settle() noexcept;  // all that needs no waiting
+  void startCheckIn() noexcept;
   void ensureChannel() noexcept;
   void checkInEnded(std::int32_t code) noexcept;
   void sendWaiting() noexcept;
@@ -132,7 +133,8 @@ class Client {
   Deadline armed_ = Deadline::never();
 
   // Interruption. A call that waits alone is woken by shutting its channel down, since nothing else ends a
-  // recvmsg in another thread, and a second descriptor to wait for would cost every call a system call.
+  // recvmsg in another thread, and a second descriptor to wait for would cost every call a system call; see
+  // docs/decisions/16-interrupted-calls.md.
   std::atomic<int> interrupters_ = 0;      // that are in interrupt() just now
   std::atomic<bool> interrupted_ = false;  // and no call has returned because of it
   std::atomic<bool> waitsOnChannel_ = false;

@@ -103,7 +103,7 @@ std::int32_t Client::begin(const RoutineFacts& routine, std::span<const std::byt
   if (number != nullptr) *number = call->result.call;
   // Those before it wait for room, which is noticed elsewhere.
   if (channel_.isValid() && calls_.waiting().size() == 1) sendWaiting();
-  ensureChannel();
+  startCheckIn();
   rearm();
   return BVMH_OK;
 }
@@ -117,7 +117,7 @@ std::int32_t Client::beginConnect(void* context, bvmh_call* number) noexcept {
   if (number != nullptr) *number = call->result.call;
   wantsChannel_ = true;
   if (channel_.isValid()) sendWaiting();
-  ensureChannel();
+  startCheckIn();
   rearm();
   return BVMH_OK;
 }
@@ -135,9 +135,14 @@ void Client::settle() noexcept {
   ensureChannel();
 }
 
+// It is process() that takes it further. So calls that are begun in a row are all begun, and end alike.
+void Client::startCheckIn() noexcept {
+  if (!channel_.isValid() && !checkIn_.isUnderWay()) checkIn_.start(address_);
+}
+
 void Client::ensureChannel() noexcept {
   while (!channel_.isValid() && !calls_.waiting().empty()) {
-    if (!checkIn_.isUnderWay()) checkIn_.start(address_);
+    startCheckIn();
     const auto code = checkIn_.advance();
     if (!code) return;
     checkInEnded(*code);
@@ -181,7 +186,8 @@ void Client::sendWaiting() noexcept {
     switch (
         sendMessage(channel_.get(), request.parts(), request.descriptors(), Deadline::never(), &waiting)) {
       case Io::done:
-        questions_.asked(call.routine->id, call.publicNumber(), now());
+        if (Questions::isQuestion(call.routine->id))
+          questions_.asked(call.routine->id, call.publicNumber(), now());
         calls_.markSent(place);
         break;
       case Io::timedOut:
@@ -322,7 +328,7 @@ std::int32_t Client::cancel(bvmh_call number) noexcept {
   if (call == nullptr) return BVMH_ERROR_NO_SUCH_CALL;
   if (call->state == BegunCall::State::sent) ++unanswered_;
   calls_.remove(*call);
-  if (!channel_.isValid()) ensureChannel();
+  if (calls_.waiting().empty()) checkIn_.abandon();
   rearm();
   return BVMH_OK;
 }

@@ -9,7 +9,7 @@
 namespace brenvik::client {
 
 // The text under a key of a binary property list whose top level is a dictionary; contract as
-// bvmh_event_text. Reads any bytes safely; keys that are not ASCII are not found.
+// bvmh_event_text. Reads any bytes safely.
 std::ptrdiff_t textOfBinaryDictionary(std::span<const std::byte> document, std::string_view key,
                                       std::span<char> buffer) noexcept;
 

@@ -20,6 +20,10 @@ constexpr std::int32_t kLocalAddress = idOf("BVMobileHelperRequestWanIPFromLocat
 
 }  // namespace
 
+bool Questions::isQuestion(std::int32_t routine) noexcept {
+  return routine == kCivicInfo || routine == kLocalAddress;
+}
+
 Questions::Kind* Questions::kindOf(std::int32_t routine) noexcept {
   return routine == kCivicInfo ? &kinds_[0] : routine == kLocalAddress ? &kinds_[1] : nullptr;
 }

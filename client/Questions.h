@@ -19,7 +19,8 @@ class Questions {
   // A push comes within about five seconds; twice that allows for a busy helper.
   static constexpr std::chrono::seconds kAnswerTime{10};
 
-  // For other routines than the two location requests it does nothing. Number 0: a blocking call.
+  static bool isQuestion(std::int32_t routine) noexcept;
+  // For what is no question it does nothing. Number 0: a blocking call.
   void asked(std::int32_t routine, bvmh_call number, Time now) noexcept;
   // The helper refused the request.
   void refused(std::int32_t routine, bvmh_call number) noexcept;

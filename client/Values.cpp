@@ -60,7 +60,7 @@ bool settle(bvmh_value* handle) noexcept {
 
 // For functions that only read: that the handle keeps its value in another form is nobody's concern.
 const PropertyList& settled(const bvmh_value* handle) noexcept {
-  static const PropertyList kNone;
+  static const PropertyList kNone{};
   return handle != nullptr && settle(const_cast<bvmh_value*>(handle)) ? handle->value : kNone;
 }
 

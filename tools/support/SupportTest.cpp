@@ -124,7 +124,7 @@ TEST(PropertyListTextTest, NothingOnATerminalCanSteerIt) {
 bvmh_event eventOf(bvmh_event_kind kind, const std::string& payload) {
   bvmh_event event{};
   event.kind = kind;
-  event.payload = {payload.data(), payload.size(), nullptr};
+  event.payload = {payload.data(), payload.size(), nullptr, nullptr};
   event.wants_reply = kind != BVMH_EVENT_NOTIFICATION;
   event.sender_pid = 12;
   return event;
