@@ -336,6 +336,24 @@ def served_with_one():
     expect_equal(property_of(SERVICE, "ActiveState"), "active", "started by the client")
 
 
+def python_works():
+    entitlement = pathlib.Path("/etc/brenvik/entitlements.d/70-python.plist")
+    entitlement.write_bytes(plistlib.dumps({"Executable": os.path.realpath(sys.executable), "Entitlements": {
+        "com.norvale.Teravox.BrenvikHelper.allow": True}}))
+    code = """from brenvik_mobile_helper import Client
+with Client() as helper:
+    helper.set_preference_value("com.example.install", "python", ["Grüße"])
+    print(helper.copy_preference_value("com.example.install", "python"))
+    helper.set_preference_value("com.example.install", "python", None)"""
+    expect_equal(run("/usr/bin/python3", "-c", code).stdout, "['Grüße']\n")
+    entitlement.unlink()
+    # The mock takes the helper's place for one command, and nobody else notices.
+    script = pathlib.Path("/tmp/answers.mock")
+    script.write_text('on CopyCountryCode\n  answer "QQ"\n')
+    expect_equal(run("brenvik-mobile-helper-mock", script, "--", "bvhelperctl", "location", "country").stdout, "QQ\n")
+    expect(bvhelperctl("location", "country", check=False).stdout != "QQ\n", "the real helper is where it was")
+
+
 def works_in_its_sandbox():
     bvhelperctl("prefs", "set", "com.example.install", "text", "Grüße")
     expect_equal(bvhelperctl("prefs", "get", "com.example.install", "text").stdout, "Grüße\n")
@@ -978,7 +996,7 @@ def purge():
 
 
 def main():
-    steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, works_in_its_sandbox,
+    steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, python_works, works_in_its_sandbox,
              stores_no_preference_where_it_would_be_lost, works_for_the_whole_phone,
              asks_the_network, beats_over_the_cellular_link, held_in_its_sandbox,
              a_helper_that_was_taken_over_is_held, a_network_worker_that_was_taken_over_is_held,

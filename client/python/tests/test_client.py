@@ -351,6 +351,7 @@ class Failures(support.InFolder):
 
         with ScriptedHelper(self.path, reads_and_leaves, until_the_end) as helper:
             client = Client(self.path)
+            client.connect()
             with self.assertRaises(package.AnswerLostError):
                 client.clear_voicemail_token()
             self.assertEqual((len(requests), helper.check_ins), (1, 1))

@@ -35,23 +35,39 @@ def _text(value: str) -> str:
     return json.dumps(value, ensure_ascii=False)
 
 
+class Entry:
+    """A request that was asked: its rule as it stands in the script."""
+
+    def __init__(self, lines: list[str]):
+        self.lines = lines
+        self.outcome = ""  # none yet
+        self.pushes: list[str] = []
+        self.begun = monotonic()
+
+    @property
+    def text(self) -> str:
+        return "\n".join(["", *self.lines, f"  {self.outcome}", *self.pushes, ""])
+
+
 class Recorder:
     """Keeps the file complete after each request, so that nothing is lost when the mock is killed."""
 
     def __init__(self, path: str):
         self._file = open(path, "w", encoding="utf-8")
-        self._rules: list[list[str]] = []
-        self._latest: dict[str, tuple[list[str], float]] = {}  # the rule of a routine's last request, and when it came
+        self._finished: list[Entry] = []
+        self._latest: dict[str, Entry] = {}  # the last request of a routine
         self._file.write(_HEAD)
         self._file.flush()
 
     def close(self) -> None:
         self._file.close()
 
-    def add(self, routine: Routine, arguments: dict, rule: Rule) -> None:
+    def begin(self, routine: Routine, arguments: dict) -> Entry:
+        """To be called before the helper is asked, whose push may come before its answer."""
         words, remarks = [f"on {routine.name}"], []
         for each in routine.parameters:
             value = arguments[each.name]
+            condition: str | None
             if each.type == "region":
                 condition = json_of(value or None)
             elif each.type == "text":
@@ -66,10 +82,13 @@ class Recorder:
                 remarks.append(f"  # {each.name} has no form in JSON, so any is taken")
             else:
                 words.append(f"{each.name}={condition}")
-        lines = [" ".join(words), *remarks, "  times 1", f"  {self._outcome(routine, rule)}"]
-        self._rules.append(lines)
-        self._latest[routine.name] = lines, monotonic()
-        self._file.write("\n" + "\n".join(lines) + "\n")
+        entry = self._latest[routine.name] = Entry([" ".join(words), *remarks, "  times 1"])
+        return entry
+
+    def finish(self, entry: Entry, routine: Routine, rule: Rule) -> None:
+        entry.outcome = self._outcome(routine, rule)
+        self._finished.append(entry)
+        self._file.write(entry.text)
         self._file.flush()
 
     @staticmethod
@@ -90,18 +109,20 @@ class Recorder:
         asked = self._latest.get(_ASKED_BY.get(type(event), "CheckLASDUpdate"))
         if asked is None:
             return  # somebody else's
-        lines, when = asked
+        after = int((monotonic() - asked.begun) * 1000)
         if type(event) in _ASKED_BY:
             word = "push civic-info" if isinstance(event, CivicInfo) else "push local-address"
             values = "".join(f" {key}={_text(value)}" for key, value in event.values.items() if isinstance(value, str))
-            lines.append(f"  {word}{values} after {int((monotonic() - when) * 1000)}")
+            asked.pushes.append(f"  {word}{values} after {after}")
         else:
             kind = str(event.values.get("Notification")).rpartition(".")[2]
             database = event.values.get("DBType")
-            lines.append(f"  notify {kind}{f' {database}' if database else ''} after {int((monotonic() - when) * 1000)}")
+            asked.pushes.append(f"  notify {kind}{f' {database}' if database else ''} after {after}")
+        if not asked.outcome:
+            return
         self._file.seek(0)
         self._file.truncate()
-        self._file.write(_HEAD + "".join("\n" + "\n".join(each) + "\n" for each in self._rules))
+        self._file.write(_HEAD + "".join(each.text for each in self._finished))
         self._file.flush()
 
 

@@ -78,7 +78,7 @@ class Mock:
     def __init__(self, script: "str | Script" = "", *, directory: "str | os.PathLike[str] | None" = None, log=None,
                  upstream: "str | os.PathLike[str] | None" = None, recorder=None):
         """`log(routine name, arguments, outcome)` is called for each request. With `upstream`, a real helper's socket, it
-        is asked instead of the script, and `recorder.add(routine, arguments, rule)` is told."""
+        is asked instead of the script, and `recorder`, a Recorder, is told."""
         self.script = parse(script) if isinstance(script, str) else script
         self._own_folder = directory is None
         self.directory = tempfile.mkdtemp(prefix="brenvik-mock-") if directory is None else os.fspath(directory)
@@ -349,6 +349,7 @@ class Mock:
         """What the real helper does, as a rule."""
         rule = Rule(0, routine)
         rule.outcome = "answer"
+        entry = self._recorder.begin(routine, arguments) if self._recorder is not None else None
         try:
             rule.value = await asyncio.get_running_loop().run_in_executor(
                 None, lambda: upstream.call(routine.name, **arguments))
@@ -356,8 +357,8 @@ class Mock:
             rule.outcome, rule.value = "fail", error.code
         except Error:
             rule.outcome = "close"
-        if self._recorder is not None:
-            self._recorder.add(routine, arguments, rule)
+        if entry is not None:
+            self._recorder.finish(entry, routine, rule)
         return rule
 
     def _tell(self, name: str, arguments: dict, outcome: str):
