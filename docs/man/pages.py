@@ -104,7 +104,7 @@ def functions():
 def functions_section():
     """The header's own comments and declarations, from its first section on."""
     text = HEADER.read_text()
-    body = text[text.index("/* ---- results"):text.index("#ifdef __cplusplus\n}")]
+    body = text[text.index("/* ---- "):text.index("#ifdef __cplusplus\n}")]
     lines, code = [], []
 
     def flush():
