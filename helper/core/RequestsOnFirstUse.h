@@ -33,6 +33,9 @@ class RequestsOnFirstUse final : public RoutineTable {
     return areas_ != nullptr ? areas_->requests().context() : nullptr;
   }
 
+  // Null before the first request.
+  const Areas* areas() const noexcept { return areas_.get(); }
+
   // Ends the work of other threads, if there is any.
   void shutDown() noexcept {
     if (areas_ != nullptr) areas_->shutDown();

@@ -103,6 +103,11 @@ class Areas {
 
   const RequestTable& requests() const noexcept { return requests_; }
 
+  // Processes that work for this one.
+  std::vector<StatusReport::Worker> workers() const {
+    return {{"network", networkWorker_.isRunning()}, {"stores", storeWorker_.isRunning()}};
+  }
+
   // Ends the work of other threads.
   void shutDown() noexcept {
     // The first two let a transfer and an unpacking under way end, for which a check would wait.
@@ -248,7 +253,10 @@ int run() {
   const auto describeCaller = [&entitlements](const AuditToken& caller) {
     return entitlements.describe(caller);
   };
-  Telling telling(ports, *loop, queues);
+  Telling telling(ports, *loop, queues, [&requests] {
+    return requests.areas() != nullptr ? requests.areas()->workers()
+                                       : std::vector<StatusReport::Worker>{{"network"}, {"stores"}};
+  });
   const ServerPlatform platform{.ports = ports,
                                 .bootstrap = bootstrap,
                                 .sources = sources,

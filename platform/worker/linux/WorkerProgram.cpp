@@ -102,6 +102,11 @@ WorkerResult WorkerProgram::open(std::uint32_t work, WorkerChannel* channel) noe
   }
 }
 
+bool WorkerProgram::isRunning() const noexcept {
+  const std::unique_lock lock(mutex_, std::try_to_lock);
+  return !lock.owns_lock() || (connection_.isOpen() && !hasHungUp(connection_, milliseconds(0)));
+}
+
 void WorkerProgram::giveUp(WorkerChannel* channel) noexcept {
   WorkerChannel given = std::move(*channel);
   const std::lock_guard lock(mutex_);

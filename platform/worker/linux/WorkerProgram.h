@@ -43,6 +43,9 @@ class WorkerProgram final : public Worker {
   WorkerResult open(std::uint32_t work, WorkerChannel* channel) noexcept override;
   void giveUp(WorkerChannel* channel) noexcept override;
 
+  // Whether a worker is connected, or being reached at this moment. Starts none, and does not wait.
+  bool isRunning() const noexcept;
+
  private:
   struct Child {
     pid_t pid = -1;
@@ -59,7 +62,7 @@ class WorkerProgram final : public Worker {
 
   const Description description_;
   const std::function<Clock::time_point()> now_;
-  std::mutex mutex_;  // guards everything below
+  mutable std::mutex mutex_;  // guards everything below
   WorkerChannel connection_;
   std::uint64_t generation_ = 0;
   Child child_;
