@@ -528,8 +528,9 @@ int main(int argc, char** argv) {
   const std::string_view only = argc > 2 ? argv[2] : "";
   if (rounds < 1 || !(only.empty() || only == "calls" || only == "regions" || only == "starts" ||
                       only == "clients" || only == "library" || only == "memory")) {
-    std::fprintf(stderr,
-                 "usage: TransportBenchmark [ROUNDS [calls | regions | starts | clients | library | memory]]\n");
+    std::fprintf(
+        stderr,
+        "usage: TransportBenchmark [ROUNDS [calls | regions | starts | clients | library | memory]]\n");
     return 2;
   }
   pinToOneProcessor();
