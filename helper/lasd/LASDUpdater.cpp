@@ -74,7 +74,10 @@ const std::shared_ptr<LASDUpdater>& LASDUpdater::shared() noexcept { return shar
 
 LASDUpdater::~LASDUpdater() = default;
 
-void LASDUpdater::configure(const Parts& parts) { parts_ = std::make_unique<Parts>(parts); }
+void LASDUpdater::configure(const Parts& parts) {
+  parts_ = std::make_unique<Parts>(parts);
+  now_ = parts.now;
+}
 
 void LASDUpdater::shutDown() noexcept { queue_.reset(); }
 
@@ -137,7 +140,7 @@ void LASDUpdater::note(std::uint32_t mask, LastCheck::Outcome outcome) noexcept 
   const std::lock_guard lock(checksMutex_);
   for (std::size_t i = 0; i < lastChecks_.size(); ++i) {
     const std::int32_t type = kDatabaseTypesInOrder[i];
-    if ((mask & static_cast<std::uint32_t>(type)) != 0) lastChecks_[i] = {type, outcome, parts_->now()};
+    if ((mask & static_cast<std::uint32_t>(type)) != 0) lastChecks_[i] = {type, outcome, now_()};
   }
 }
 
@@ -145,7 +148,7 @@ void LASDUpdater::noteEnd() noexcept {
   const std::lock_guard lock(checksMutex_);
   for (LastCheck& each : lastChecks_) {
     if (each.outcome == LastCheck::Outcome::checking)
-      each = {each.type, LastCheck::Outcome::failed, parts_->now()};
+      each = {each.type, LastCheck::Outcome::failed, now_()};
   }
 }
 

@@ -105,6 +105,7 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
   void noteEnd() noexcept;
 
   std::unique_ptr<Parts> parts_;
+  std::function<std::chrono::nanoseconds()> now_ = timeSinceBoot;
   // By type, the record found here or, once it needs an update, the server's; none when there is no record.
   std::map<std::int32_t, PropertyList> versions_;  // on the queue only
   // The types of the present check for which memory did not suffice.

@@ -40,6 +40,8 @@ class WorkerTest:
             os.kill(worker, how)
         except ProcessLookupError:
             return False
+        if how == signal.SIGKILL:  # what is asked of one that is still going is lost with it
+            eventually(lambda: self.daemon.network_worker() != worker)
         return True
 
     def status(self):

@@ -242,7 +242,8 @@ class Command(StatusTest):
                          (self.daemon.pid, str(DAEMON), {"path": str(SOCKET), "state": "listening"}))
         self.assertEqual((told["version"], told["restartPending"]), (told["installed"], False))
         self.assertEqual((told["clients"], told["heldBy"], told["leavesIn"], told["busyTokens"]), (0, [], None, 0))
-        self.assertEqual((told["databases"], told["locationAnswer"], told["workers"]), ([], None, []))
+        self.assertEqual((told["databases"], told["locationAnswer"], told["workers"]),
+                         ([], None, [{"name": "network", "running": False}, {"name": "stores", "running": False}]))
         self.assertNotIn("notes", told)
         lines = run("status").stdout.splitlines()
         self.assertRegex(lines[0], rf"^helper        running since \d{{4}}-\d\d-\d\dT\d\d:\d\d:\d\dZ \(\d+ s\), process {self.daemon.pid}$")

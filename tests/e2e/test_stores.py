@@ -119,8 +119,10 @@ class Attacks(StoresTest):
         def work():
             with open(f"{database}-journal", "wb") as file:
                 file.write(head)
-                for _ in range(pages):
-                    file.write(record)
+                many = record * 4096
+                for _ in range(pages // 4096):
+                    file.write(many)
+                file.write(record * (pages % 4096))
                 file.write(end)
         self.as_mobile(work)
 
@@ -157,10 +159,10 @@ class Attacks(StoresTest):
         self.set_token()
         self.make_contacts()
         other = self.client()
-        for database, use, seconds in ((VOICEMAIL, self.token, 3), (CONTACTS, self.remap, 4.5)):
+        for database, use, seconds, pages in ((VOICEMAIL, self.token, 3, 2_000_000), (CONTACTS, self.remap, 4.5, 5_000_000)):
             # With the smallest pages there are: rolling so many back takes far longer than anybody is to wait.
             self.as_mobile(lambda: sqlite3.connect(database).executescript("PRAGMA page_size=512; VACUUM") and None)
-            self.plant(database, pages=1_500_000)
+            self.plant(database, pages=pages)
             with self.within(seconds):
                 use()
             self.logs.wait_for("unified", ERROR, f"{WORKER} does not answer as it should, and is ended")
