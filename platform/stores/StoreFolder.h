@@ -31,8 +31,8 @@ class StoreFolder {
 
   virtual ~StoreFolder() = default;
   virtual State open(IfMissing ifMissing, Opened* folder) noexcept = 0;
-  // Gives the folder and the store's files in it to "mobile" where they are root's and nobody but root can
-  // have put them there. True when something was given.
+  // Gives the folder and the store's files in it to "mobile" where they are root's, and either nobody but
+  // root can have put them there or everybody may read them. True when something was given.
   virtual bool prepare(const Opened& folder) noexcept = 0;
 };
 

@@ -235,6 +235,19 @@ class Places(StoresTest):
             self.assertEqual(self.remap(), 1)
             self.assertEqual(self.channel(), "new")
 
+    def test_open_folders_that_root_has_made_in_mobiles_own_are_used(self):
+        for own in ((HOME,), (HOME, LIBRARY), (LIBRARY,)):
+            subprocess.run(["rm", "-rf", HOME], check=True)
+            CONTACTS.parent.mkdir(parents=True)
+            VOICEMAIL.parent.mkdir()
+            for path in own:
+                os.chown(path, MOBILE.pw_uid, MOBILE.pw_gid)
+            self.make_contacts(as_root=True)
+            self.assertEqual(self.remap(), 1)
+            self.assertEqual(self.channel(), "new")
+            self.set_token()
+            self.assertEqual(self.token(), "token")
+
     def test_a_database_that_root_puts_where_it_has_been_given_away_is_used_again(self):
         for _ in range(3):
             CONTACTS.parent.mkdir(parents=True, exist_ok=True)

@@ -31,7 +31,8 @@ constexpr mode_t kOwnerMayAdd = 0300;
 constexpr std::size_t kMostClosed = 1000;
 
 // The same step by step, for a service manager's filter against set-id files: it cannot look into the
-// arguments of openat2(2) and refuses the call whole. Nothing else writes in the stage meanwhile.
+// arguments of openat2(2) and refuses the call whole, or for one that is older than the call. Nothing else
+// writes in the stage meanwhile.
 UniqueFd walkBeneath(int top, const char* path, int flags) {
   UniqueFd at;
   for (std::string_view rest(path);;) {
@@ -57,7 +58,7 @@ UniqueFd openBeneath(int top, const char* path, int flags) {
   do {
     fd = ::syscall(SYS_openat2, top, path, &how, sizeof how);
   } while (fd < 0 && (errno == EAGAIN || errno == EINTR));  // EAGAIN: a rename crossed the walk
-  if (fd < 0 && errno == ENOSYS) return walkBeneath(top, path, flags);
+  if (fd < 0 && (errno == ENOSYS || errno == EPERM)) return walkBeneath(top, path, flags);
   return UniqueFd(static_cast<int>(fd));
 }
 

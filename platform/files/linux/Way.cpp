@@ -28,8 +28,8 @@ bool openWithoutLinks(const std::string& path, int flags, UniqueFd* item) {
 }
 
 // ELOOP: there is a link on the way. ENOSYS: a service manager's filter, which cannot look into the
-// arguments.
-bool mayHaveLinks(int error) { return error == ELOOP || error == ENOSYS; }
+// arguments. EPERM: a filter that is older than the call.
+bool mayHaveLinks(int error) { return error == ELOOP || error == ENOSYS || error == EPERM; }
 
 bool leadsUp(std::string_view target) {
   return ("/" + std::string(target) + "/").find("/../") != std::string::npos;

@@ -34,6 +34,8 @@ class PreparedFolder final : public StoreFolder {
 
  private:
   State walk(IfMissing ifMissing, Opened* folder);
+  bool isGivenWhole(int folder, const Account& account) const;
+  bool holdsOnlyAnOpenDatabase(int folder) const;
   bool giveAll(int folder, const Account& account) const;
   bool giveOpenDatabase(int folder, const Account& account) const;
 

@@ -155,14 +155,74 @@ TEST_F(PreparedFolderTest, WhereSomebodyElseMayWriteOnTheWayNothingOfRootsIsGive
       EXPECT_EQ(ownerOf(store + "/store.db"), 0U) << how;
     };
     for (const std::string& writable : {root, root + "/Library", store}) {
-      ASSERT_EQ(::chmod(writable.c_str(), 01777), 0);
+      ASSERT_EQ(::chmod(writable.c_str(), 0777), 0);
       expectNothingGiven("everybody writes");
       ASSERT_EQ(::chmod(writable.c_str(), 0775), 0);
       expectNothingGiven("the group writes");
       ASSERT_EQ(::chmod(writable.c_str(), 0755), 0);
     }
-    ASSERT_EQ(::chown(root.c_str(), kMobile, kGroup), 0);
-    expectNothingGiven("the home is the account's");
+    ASSERT_EQ(::chmod(store.c_str(), 01777), 0);
+    expectNothingGiven("everybody puts files there");
+    ASSERT_EQ(::chmod(store.c_str(), 0755), 0);
+    ASSERT_EQ(::chown(root.c_str(), 99, 99), 0);
+    expectNothingGiven("the home is a third one's");
+  });
+}
+
+TEST_F(PreparedFolderTest, WhereEverybodyMayPutFoldersOfHisOwnRootsAreStillRoots) {
+  inRootsHome([&](const std::string& root) {
+    write(root + "/Library/Store/store.db", kDatabase, 0600);
+    ASSERT_EQ(::chmod("/mnt", 01777), 0);
+    ASSERT_EQ(open(folderOf(root)), State::open);
+    EXPECT_TRUE(folderOf(root).prepare(opened));
+    EXPECT_EQ(ownerOf(root + "/Library/Store/store.db"), kMobile);
+  });
+}
+
+TEST_F(PreparedFolderTest, InAHomeOfTheAccountsAFolderOfRootsIsGivenIfItHoldsNothingButAnOpenDatabase) {
+  inRootsHome([&](const std::string& root) {
+    const std::string library = root + "/Library";
+    const std::string store = library + "/Store";
+    const auto isGiven = [&](const std::function<void()>& make) {
+      std::filesystem::remove_all(library);
+      std::filesystem::create_directories(store);
+      EXPECT_EQ(::chown(root.c_str(), kMobile, kGroup), 0);
+      make();
+      EXPECT_EQ(open(folderOf(root)), State::open);
+      const bool says = folderOf(root).prepare(opened);
+      EXPECT_EQ(says, ownerOf(store) == kMobile);
+      if (isThere(store + "/store.db")) {
+        EXPECT_EQ(says, ownerOf(store + "/store.db") == kMobile);
+      }
+      return says;
+    };
+    const auto put = [&](const char* name, const std::string& content = kDatabase, mode_t mode = 0644) {
+      return [=] { write(store + "/" + name, content, mode); };
+    };
+    const auto withDatabase = [&](std::function<void()> more) {
+      return [=] {
+        write(store + "/store.db");
+        more();
+      };
+    };
+    EXPECT_TRUE(isGiven(put("store.db")));
+    EXPECT_TRUE(isGiven(put("store.db", "")));
+    EXPECT_TRUE(isGiven([] {})) << "empty";
+    EXPECT_TRUE(isGiven(withDatabase(put("store.db-journal", "a journal"))));
+    EXPECT_TRUE(isGiven(withDatabase([&] { ASSERT_EQ(::chown(library.c_str(), kMobile, kGroup), 0); })));
+
+    EXPECT_FALSE(isGiven(put("store.db", kDatabase, 0600)));
+    EXPECT_FALSE(isGiven(put("store.db", "not a database")));
+    EXPECT_FALSE(isGiven(put("store.db", kDatabase, 04755)));
+    EXPECT_FALSE(isGiven(withDatabase(put("store.db-wal", "private", 0640))));
+    EXPECT_FALSE(isGiven(withDatabase(put("another"))));
+    EXPECT_FALSE(isGiven(withDatabase([&] { std::filesystem::create_directory(store + "/store.db-shm"); })));
+    EXPECT_FALSE(isGiven(withDatabase([&] { ASSERT_EQ(::chmod(store.c_str(), 0700), 0); })));
+    EXPECT_FALSE(isGiven(withDatabase([&] { ASSERT_EQ(::chmod(library.c_str(), 0700), 0); })));
+    EXPECT_FALSE(isGiven(withDatabase([&] { ASSERT_EQ(::chmod(library.c_str(), 0777), 0); })));
+    EXPECT_FALSE(isGiven(withDatabase([&] { ASSERT_EQ(::chown(library.c_str(), 99, 99), 0); })));
+    EXPECT_FALSE(isGiven(withDatabase(
+        [&] { ASSERT_EQ(::link((store + "/store.db").c_str(), (root + "/second").c_str()), 0); })));
   });
 }
 

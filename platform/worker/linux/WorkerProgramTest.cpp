@@ -15,6 +15,8 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <functional>
+#include <iterator>
 #include <string>
 #include <thread>
 #include <vector>
@@ -25,6 +27,7 @@
 #include "platform/worker/WorkerFields.h"
 #include "platform/worker/linux/SealedMemory.h"
 #include "platform/worker/linux/WorkerHost.h"
+#include "platform/worker/linux/WorkerRights.h"
 #include "testing/Works.h"
 
 namespace brenvik {
@@ -42,6 +45,25 @@ bool hasManyAccounts() {
   std::uint64_t outside = 0;
   std::uint64_t count = 0;
   return static_cast<bool>(map >> inside >> outside >> count) && inside == 0 && count > 65534;
+}
+
+// Runs work() as root of such a namespace; it answers 0 when all is well.
+void inANamespaceWithOneAccount(const std::function<int()>& work) {
+  const uid_t uid = ::geteuid();
+  const gid_t gid = ::getegid();
+  const pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    if (::unshare(CLONE_NEWUSER) != 0) ::_exit(77);
+    std::ofstream("/proc/self/setgroups") << "deny";
+    std::ofstream("/proc/self/uid_map") << "0 " << uid << " 1";
+    std::ofstream("/proc/self/gid_map") << "0 " << gid << " 1";
+    ::_exit(work());
+  }
+  int status = -1;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  if (WIFEXITED(status) && WEXITSTATUS(status) == 77) GTEST_SKIP() << "no user namespaces to be had";
+  EXPECT_EQ(status, 0);
 }
 
 std::vector<pid_t> children() {
@@ -155,28 +177,37 @@ TEST_F(WorkerProgramTest, AWorkerHasNothingButWhatItWasGiven) {
 }
 
 TEST_F(WorkerProgramTest, InANamespaceWithOneAccountThatStaysWithoutACapability) {
-  const uid_t uid = ::geteuid();
-  const gid_t gid = ::getegid();
-  const pid_t child = ::fork();
-  ASSERT_GE(child, 0);
-  if (child == 0) {
-    if (::unshare(CLONE_NEWUSER) != 0) ::_exit(77);
-    std::ofstream("/proc/self/setgroups") << "deny";
-    std::ofstream("/proc/self/uid_map") << "0 " << uid << " 1";
-    std::ofstream("/proc/self/gid_map") << "0 " << gid << " 1";
+  inANamespaceWithOneAccount([&] {
     WorkerProgram worker(description());
     WorkerChannel channel;
-    if (open(worker, WorkForTests::report, &channel) != WorkerResult::done) ::_exit(2);
-    if (receive(channel) != WorkerResult::done) ::_exit(3);
+    if (open(worker, WorkForTests::report, &channel) != WorkerResult::done) return 2;
+    if (receive(channel) != WorkerResult::done) return 3;
     FieldReader reader(message.payload);
     const bool keptAccount = reader.u32() == 0 && reader.u32() == 0;
     (void)reader.text();
     const bool hasNothing = reader.text() == "0000000000000000";
-    ::_exit(keptAccount && hasNothing ? 0 : 4);
+    return keptAccount && hasNothing ? 0 : 4;
+  });
+}
+
+TEST_F(WorkerProgramTest, AnAccountOfRootsNumberServesOnlyWhereThereIsNoOther) {
+  const WorkerRights asRoot{.accounts = {"root"}, .keptCapabilities = {}};
+  inANamespaceWithOneAccount([&] {
+    const bool goesOn = giveUpRights(asRoot) == nullptr;
+    std::ifstream status("/proc/thread-self/status");
+    const std::string text((std::istreambuf_iterator<char>(status)), std::istreambuf_iterator<char>());
+    const bool hasNothing = text.find("CapPrm:\t0000000000000000") != std::string::npos;
+    return goesOn && hasNothing ? 0 : 4;
+  });
+  if (::geteuid() != 0 || !hasManyAccounts()) return;
+  const pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    const char* const why = giveUpRights(asRoot);
+    ::_exit(why != nullptr && std::strcmp(why, "the account is root's") == 0 ? 0 : 4);
   }
   int status = -1;
   ASSERT_EQ(::waitpid(child, &status, 0), child);
-  if (WIFEXITED(status) && WEXITSTATUS(status) == 77) GTEST_SKIP() << "no user namespaces to be had";
   EXPECT_EQ(status, 0);
 }
 

@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/worker/linux/WorkerRights.h"
 
+#include <fcntl.h>
 #include <grp.h>
 #include <linux/audit.h>
 #include <linux/capability.h>
@@ -16,8 +17,12 @@
 #include <cerrno>
 #include <cstddef>
 #include <cstdint>
+#include <cstdio>
+#include <cstring>
 #include <new>
 #include <optional>
+
+#include "platform/base/UniqueFd.h"
 
 namespace brenvik {
 namespace {
@@ -56,6 +61,19 @@ bool hasOnly(const std::vector<int>& kept) noexcept {
     data[capability / 32].permitted &= ~(1U << (static_cast<unsigned>(capability) % 32));
   return data[0].permitted == 0 && data[1].permitted == 0 && data[0].inheritable == 0 &&
          data[1].inheritable == 0;
+}
+
+// Whether root is the only account of this process's user namespace: then it is everybody's.
+bool isOnlyAccount() noexcept {
+  const UniqueFd map(::open("/proc/self/uid_map", O_RDONLY | O_CLOEXEC));
+  char text[128];
+  const ssize_t length = map.isValid() ? ::read(map.get(), text, sizeof text - 1) : 0;
+  if (length <= 0) return false;
+  text[length] = '\0';
+  unsigned long first = 0;
+  unsigned long count = 0;
+  return std::strchr(text, '\n') == text + length - 1 &&
+         std::sscanf(text, "%lu %*u %lu", &first, &count) == 2 && first == 0 && count == 1;
 }
 
 // Whether the numbers exist in this process's user namespace: the kernel refuses the others as invalid.
@@ -133,11 +151,12 @@ const char* giveUpRights(const WorkerRights& rights) noexcept {
     if (::geteuid() == 0 || ::getuid() == 0) {
       const std::optional<Ids> ids = accountFor(rights);
       if (!ids) return "the account does not exist";
-      if (ids->uid == 0 || ids->gid == 0) return "the account is root's";
+      const bool isRoots = ids->uid == 0 || ids->gid == 0;
+      if (isRoots && !isOnlyAccount()) return "the account is root's";
       if (rights.keptCapabilities) kept = rights.keptCapabilities(ids->gid);
       // Else they go with the account.
       if (!kept.empty() && ::prctl(PR_SET_KEEPCAPS, 1, 0, 0, 0) != 0) return "no capability can be kept";
-      const Became became = become(*ids);
+      const Became became = isRoots ? Became::onlyAccount : become(*ids);
       if (became == Became::nothing) return "root's account cannot be left";
       if (became == Became::account) {
         // Before the way back is tried, which they would open.
