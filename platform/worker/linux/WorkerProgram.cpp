@@ -72,6 +72,13 @@ bool WorkerProgram::mayLog() noexcept {
 
 WorkerResult WorkerProgram::open(std::uint32_t work, WorkerChannel* channel) noexcept {
   channel->close();
+  if (!WorkerChannel::hasRoomToDistrust()) {
+    const std::lock_guard lock(mutex_);
+    if (mayLog())
+      logUnified(LogLevel::error, "%s is not asked: too much of what workers sent cannot be closed",
+                 description_.program.c_str());
+    return WorkerResult::unavailable;
+  }
   WorkerChannel ours;
   WorkerChannel theirs;
   if (const WorkerResult made = WorkerChannel::makePair(&ours, &theirs); made != WorkerResult::done)
@@ -146,7 +153,9 @@ WorkerResult WorkerProgram::reach() {
   std::erase_if(dying_, [](const Child& child) { return isReaped(child, milliseconds(0)); });
   WorkerResult reached = connectToService();
   if (reached == WorkerResult::closed) reached = startChild();
-  if (reached == WorkerResult::done) ++generation_;
+  if (reached != WorkerResult::done) return reached;
+  connection_.distrust();
+  ++generation_;
   return reached;
 }
 

@@ -23,6 +23,7 @@
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/worker/WorkerFields.h"
+#include "platform/worker/fakes/LingeringSocket.h"
 #include "platform/worker/linux/SealedMemory.h"
 #include "platform/worker/linux/WorkerHost.h"
 #include "testing/Works.h"
@@ -327,6 +328,42 @@ TEST_F(WorkerServiceTest, WhereSomebodyListensNoProgramIsStarted) {
   host.join();
   EXPECT_EQ(work, static_cast<std::uint32_t>(WorkForTests::echo));
   EXPECT_TRUE(children().empty());
+}
+
+TEST_F(WorkerServiceTest, WhatAWorkerSendsOverTheMainConnectionKeepsNobodyWaiting) {
+  LingeringSocket lingering;
+  const UniqueFd socket = listen();
+  WorkerProgram worker(description());
+  WorkerChannel channel;
+  ASSERT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::done);
+  WorkerChannel connection(UniqueFd(::accept4(socket.get(), nullptr, nullptr, SOCK_CLOEXEC)));
+  message.descriptors.push_back(std::move(lingering.socket));
+  ASSERT_EQ(connection.send(message), WorkerResult::done);
+  message.descriptors.clear();  // the last one is on its way now
+  const auto before = Clock::now();
+  worker.giveUp(&channel);
+  EXPECT_LT(Clock::now() - before, 1s);
+}
+
+TEST_F(WorkerServiceTest, NobodyIsAskedWhileTooMuchWaitsToBeClosed) {
+  std::vector<LingeringSocket> lingering(10);
+  WorkerProgram worker(description());
+  WorkerChannel ours;
+  ours.distrust();
+  const auto wait = [&](UniqueFd descriptor) {
+    message.descriptors.push_back(std::move(descriptor));
+    ours.discard(&message);
+  };
+  for (LingeringSocket& each : lingering) wait(std::move(each.socket));
+  for (int i = 0; i < 1000; ++i) wait(UniqueFd(::dup(STDERR_FILENO)));
+  WorkerChannel channel;
+  EXPECT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::unavailable);
+  EXPECT_TRUE(children().empty());
+  ASSERT_EQ(log.entries().size(), 1U);
+  EXPECT_EQ(lines()[0], "worker_for_tests is not asked: too much of what workers sent cannot be closed");
+  lingering.clear();  // what has no peer lingers no more
+  while (!WorkerChannel::hasRoomToDistrust()) std::this_thread::yield();
+  EXPECT_TRUE(works(worker));
 }
 
 TEST_F(WorkerServiceTest, ASocketThatNobodyListensBehindIsAsGoodAsNone) {
