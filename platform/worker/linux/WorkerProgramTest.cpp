@@ -3,8 +3,10 @@
 #include "platform/worker/linux/WorkerProgram.h"
 
 #include <fcntl.h>
+#include <grp.h>
 #include <gtest/gtest.h>
 #include <sched.h>
+#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <sys/wait.h>
@@ -15,6 +17,7 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -80,6 +83,13 @@ class WorkerProgramTest : public testing::Test {
     EXPECT_EQ(receive(channel), WorkerResult::closed);
     worker.giveUp(&channel);
   }
+  // A report of what the worker has, in `message`.
+  WorkerResult askForReport() {
+    WorkerProgram worker(description());
+    WorkerChannel channel;
+    const WorkerResult opened = open(worker, WorkForTests::report, &channel);
+    return opened == WorkerResult::done ? receive(channel) : opened;
+  }
   std::vector<std::string> lines() const {
     std::vector<std::string> texts;
     for (const auto& entry : log.entries()) texts.push_back(entry.line);
@@ -135,7 +145,11 @@ TEST_F(WorkerProgramTest, AWorkerHasNothingButWhatItWasGiven) {
   const int internet = static_cast<int>(reader.u32());
   const int netlink = static_cast<int>(reader.u32());
   const int local = static_cast<int>(reader.u32());
+  const bool leadsItsSession = reader.boolean();
+  const std::string at(reader.text());
   ASSERT_TRUE(reader.whole());
+  EXPECT_TRUE(leadsItsSession) << "a terminal on standard error would take commands from it (TIOCSTI)";
+  EXPECT_EQ(at, "/") << "a folder that nobody else can walk to is no place to start from";
   EXPECT_EQ(capabilities, "0000000000000000");
   EXPECT_EQ(noNewPrivileges, "1");
   EXPECT_EQ(variables, 0U);
@@ -155,20 +169,23 @@ TEST_F(WorkerProgramTest, AWorkerHasNothingButWhatItWasGiven) {
   ::unsetenv("BRENVIK_LEAK");
 }
 
-TEST_F(WorkerProgramTest, InANamespaceWithOneAccountThatStaysWithoutACapability) {
-  const uid_t uid = ::geteuid();
-  const gid_t gid = ::getegid();
+// What becomes of a worker in a user namespace where only 0 exists, which is this account outside.
+enum class InNamespace { keptItsAccount, left, none, failed };
+InNamespace runInNamespaceOf(uid_t uid, gid_t gid, const std::function<WorkerResult()>& report,
+                             const WorkerMessage& message) {
   const pid_t child = ::fork();
-  ASSERT_GE(child, 0);
   if (child == 0) {
+    if (::geteuid() != uid &&
+        (::setgroups(0, nullptr) != 0 || ::setresgid(gid, gid, gid) != 0 || ::setresuid(uid, uid, uid) != 0))
+      ::_exit(5);
+    (void)::prctl(PR_SET_DUMPABLE, 1, 0, 0, 0);  // or /proc/self belongs to root
     if (::unshare(CLONE_NEWUSER) != 0) ::_exit(77);
     std::ofstream("/proc/self/setgroups") << "deny";
     std::ofstream("/proc/self/uid_map") << "0 " << uid << " 1";
     std::ofstream("/proc/self/gid_map") << "0 " << gid << " 1";
-    WorkerProgram worker(description());
-    WorkerChannel channel;
-    if (open(worker, WorkForTests::report, &channel) != WorkerResult::done) ::_exit(2);
-    if (receive(channel) != WorkerResult::done) ::_exit(3);
+    const WorkerResult result = report();
+    if (result == WorkerResult::closed) ::_exit(1);
+    if (result != WorkerResult::done) ::_exit(3);
     FieldReader reader(message.payload);
     const bool keptAccount = reader.u32() == 0 && reader.u32() == 0;
     (void)reader.text();
@@ -176,9 +193,38 @@ TEST_F(WorkerProgramTest, InANamespaceWithOneAccountThatStaysWithoutACapability)
     ::_exit(keptAccount && hasNothing ? 0 : 4);
   }
   int status = -1;
-  ASSERT_EQ(::waitpid(child, &status, 0), child);
-  if (WIFEXITED(status) && WEXITSTATUS(status) == 77) GTEST_SKIP() << "no user namespaces to be had";
-  EXPECT_EQ(status, 0);
+  if (child < 0 || ::waitpid(child, &status, 0) != child || !WIFEXITED(status)) return InNamespace::failed;
+  switch (WEXITSTATUS(status)) {
+    case 0:
+      return InNamespace::keptItsAccount;
+    case 1:
+      return InNamespace::left;
+    case 77:
+      return InNamespace::none;
+    default:
+      ADD_FAILURE() << "status " << WEXITSTATUS(status);
+      return InNamespace::failed;
+  }
+}
+
+TEST_F(WorkerProgramTest, InANamespaceWithOneAccountThatStaysWithoutACapability) {
+  const bool canChoose = ::geteuid() == 0 && hasManyAccounts();
+  if (::geteuid() == 0 && !canChoose) GTEST_SKIP() << "there is no account but root";
+  const uid_t uid = canChoose ? 65534 : ::geteuid();
+  const gid_t gid = canChoose ? 65534 : ::getegid();
+  ASSERT_TRUE(!canChoose || ::chown(folder.path().c_str(), uid, gid) == 0);
+  const auto became = runInNamespaceOf(
+      uid, gid, [&] { return askForReport(); }, message);
+  if (became == InNamespace::none) GTEST_SKIP() << "no user namespaces to be had";
+  EXPECT_EQ(became, InNamespace::keptItsAccount);
+}
+
+TEST_F(WorkerProgramTest, InANamespaceWhereTheOneAccountIsRootOutsideItDoesNotRun) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root";
+  const auto became = runInNamespaceOf(
+      0, 0, [&] { return askForReport(); }, message);
+  if (became == InNamespace::none) GTEST_SKIP() << "no user namespaces to be had";
+  EXPECT_EQ(became, InNamespace::left);
 }
 
 TEST_F(WorkerProgramTest, DeathHangsUpAllChannelsAndTheNextOneHasANewWorker) {

@@ -16,6 +16,7 @@
 #include <cerrno>
 #include <cstddef>
 #include <cstdint>
+#include <fstream>
 #include <new>
 #include <optional>
 
@@ -66,6 +67,33 @@ Became become(const Ids& ids) noexcept {
   if (::setresuid(ids.uid, ids.uid, ids.uid) != 0)
     return errno == EINVAL ? Became::onlyAccount : Became::nothing;
   return hasNoGroups && isOfGroup ? Became::account : Became::nothing;
+}
+
+// Whether this user namespace has `id`, and what its number 0 is outside; nothing when that cannot be told.
+struct Outside {
+  bool isKnown = false;
+  bool hasId = false;
+  bool isRootRoot = false;
+};
+Outside lookOutside(const char* mapPath, std::uint64_t id) {
+  Outside found;
+  std::ifstream map(mapPath);
+  std::uint64_t inside = 0;
+  std::uint64_t outside = 0;
+  std::uint64_t count = 0;
+  while (map >> inside >> outside >> count) {
+    found.isKnown = true;
+    if (id >= inside && id - inside < count) found.hasId = true;
+    if (inside == 0 && outside == 0) found.isRootRoot = true;
+  }
+  return found;
+}
+
+// An account that cannot be left is no root outside, so what it owns is not root's; and there is no other.
+bool isHarmlessAccount(const Ids& ids) {
+  const Outside user = lookOutside("/proc/self/uid_map", ids.uid);
+  const Outside group = lookOutside("/proc/self/gid_map", ids.gid);
+  return user.isKnown && !user.hasId && !user.isRootRoot && group.isKnown && !group.isRootRoot;
 }
 
 bool isOrdinaryForGood() noexcept {
@@ -138,7 +166,8 @@ const char* giveUpRights(const WorkerRights& rights) noexcept {
       // Else they go with the account.
       if (!kept.empty() && ::prctl(PR_SET_KEEPCAPS, 1, 0, 0, 0) != 0) return "no capability can be kept";
       const Became became = become(*ids);
-      if (became == Became::nothing) return "root's account cannot be left";
+      if (became == Became::nothing || (became == Became::onlyAccount && !isHarmlessAccount(*ids)))
+        return "root's account cannot be left";
       if (became == Became::account) {
         // Before the way back is tried, which they would open.
         if (!setCapabilities(kept)) return "capabilities cannot be dropped";

@@ -30,8 +30,8 @@ struct WorkerRights {
 
 // Gives up everything else for good: root's account and groups, capabilities, new privileges through exec(2),
 // core dumps, and being looked at by other processes of the account. Then checks that there is no way back.
-// In a user namespace that has one account only, that account stays. Null, or in words what went wrong: then
-// the process must not go on. Before other threads start.
+// In a user namespace that has one account only, that account stays, unless it is root outside. Null, or in
+// words what went wrong: then the process must not go on. Before other threads start.
 const char* giveUpRights(const WorkerRights& rights) noexcept;
 
 }  // namespace brenvik
