@@ -2,6 +2,8 @@
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 """What "mobile" can do with the databases below its home: nothing to root's files, and nobody waits for it long."""
 import contextlib
+import ctypes
+import errno
 import os
 import pathlib
 import pwd
@@ -11,6 +13,7 @@ import socket
 import sqlite3
 import struct
 import subprocess
+import sys
 import time
 
 import wire
@@ -276,7 +279,55 @@ class Places(StoresTest):
         self.assertEqual(self.token(), "old")
 
 
+def ways_into(pid):
+    """What this process can do with another one of its account beyond signals: the names of what succeeds."""
+    libc = ctypes.CDLL(None, use_errno=True)
+    word = ctypes.create_string_buffer(8)
+    vector = struct.pack("NN", ctypes.addressof(word), 8)
+    theirs = struct.pack("NN", 0x400000, 8)
+    pidfd = os.pidfd_open(pid)
+    calls = {"pidfd_getfd": lambda: libc.syscall(438, pidfd, 0, 0),
+             "process_vm_readv": lambda: libc.process_vm_readv(pid, vector, 1, theirs, 1, 0),
+             "PTRACE_SEIZE": lambda: libc.ptrace(0x4206, pid, 0, 0),
+             "PTRACE_ATTACH": lambda: libc.ptrace(16, pid, 0, 0)}
+    found = []
+    for name, call in calls.items():
+        ctypes.set_errno(0)
+        if call() >= 0 or ctypes.get_errno() not in (errno.EPERM, errno.EACCES):
+            found.append(f"{name}: {os.strerror(ctypes.get_errno())}")
+    folder = f"/proc/{pid}"
+    for name in ("mem", "maps", "environ", "auxv", "syscall", "stack", "fd/0", "task", "coredump_filter", "oom_score_adj"):
+        with contextlib.suppress(PermissionError):
+            if name == "task":
+                os.listdir(f"{folder}/task/{pid}/fd")
+            else:
+                os.close(os.open(f"{folder}/{name}", os.O_RDWR if name in ("mem", "oom_score_adj", "coredump_filter") else os.O_RDONLY))
+            found.append(name)
+    for name in ("cwd", "root", "exe", "fd/0", "ns/mnt"):
+        with contextlib.suppress(PermissionError):
+            os.readlink(f"{folder}/{name}")
+            found.append(f"link {name}")
+    return found
+
+
+def tell_ways_into(pid):
+    """How many there are."""
+    found = ways_into(pid)
+    sys.stderr.write("".join(f"a way into the worker: {each}\n" for each in found))
+    return len(found)
+
+
 class Worker(StoresTest):
+    def test_its_own_account_looks_into_it_no_more_than_anybody_else(self):
+        self.set_token()
+        worker, = self.workers()
+        own = subprocess.Popen(["/bin/sleep", "60"], user=MOBILE.pw_uid, group=MOBILE.pw_gid, extra_groups=[])
+        self.addCleanup(own.wait)
+        self.addCleanup(own.kill)
+        self.assertEqual(as_account("mobile", lambda: int("mem" in ways_into(own.pid))), 1, "these are ways")
+        self.assertEqual(as_account("mobile", lambda: tell_ways_into(worker)), 0)
+        self.assertEqual(self.token(), "token")
+
     def status(self, pid):
         lines = pathlib.Path(f"/proc/{pid}/status").read_text().splitlines()
         return dict(line.split(":\t", 1) for line in lines if ":\t" in line)
@@ -402,6 +453,11 @@ class Service(StoresTest):
         os.kill(self.daemon.pid, signal.SIGKILL)
         self.daemon.wait()
         self.assertEqual(self.worker.wait(10), 0)
+
+    def test_its_own_account_looks_into_it_no_more_than_anybody_else(self):
+        self.set_token()
+        self.assertEqual(as_account("mobile", lambda: tell_ways_into(self.worker.pid)), 0)
+        self.assertEqual(self.token(), "token")
 
     def test_while_none_is_started_an_operation_fails_in_time_and_the_next_one_has_the_new_one(self):
         self.set_token()
