@@ -2,8 +2,6 @@
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 """What "mobile" can do with the databases below its home: nothing to root's files, and nobody waits for it long."""
 import contextlib
-import ctypes
-import errno
 import os
 import pathlib
 import pwd
@@ -13,11 +11,11 @@ import socket
 import sqlite3
 import struct
 import subprocess
-import sys
 import time
 
 import wire
 from harness import BUILD, ERROR, HelperTest, as_account, eventually, listen, main
+from intrusion import tell_ways_into, ways_into
 
 HOME = pathlib.Path("/var/mobile")
 LIBRARY = HOME / "Library"
@@ -279,44 +277,6 @@ class Places(StoresTest):
         self.assertEqual(self.token(), "old")
 
 
-def ways_into(pid):
-    """What this process can do with another one of its account beyond signals: the names of what succeeds."""
-    libc = ctypes.CDLL(None, use_errno=True)
-    word = ctypes.create_string_buffer(8)
-    vector = struct.pack("NN", ctypes.addressof(word), 8)
-    theirs = struct.pack("NN", 0x400000, 8)
-    pidfd = os.pidfd_open(pid)
-    calls = {"pidfd_getfd": lambda: libc.syscall(438, pidfd, 0, 0),
-             "process_vm_readv": lambda: libc.process_vm_readv(pid, vector, 1, theirs, 1, 0),
-             "PTRACE_SEIZE": lambda: libc.ptrace(0x4206, pid, 0, 0),
-             "PTRACE_ATTACH": lambda: libc.ptrace(16, pid, 0, 0)}
-    found = []
-    for name, call in calls.items():
-        ctypes.set_errno(0)
-        if call() >= 0 or ctypes.get_errno() not in (errno.EPERM, errno.EACCES):
-            found.append(f"{name}: {os.strerror(ctypes.get_errno())}")
-    folder = f"/proc/{pid}"
-    for name in ("mem", "maps", "environ", "auxv", "syscall", "stack", "fd/0", "task", "coredump_filter", "oom_score_adj"):
-        with contextlib.suppress(PermissionError):
-            if name == "task":
-                os.listdir(f"{folder}/task/{pid}/fd")
-            else:
-                os.close(os.open(f"{folder}/{name}", os.O_RDWR if name in ("mem", "oom_score_adj", "coredump_filter") else os.O_RDONLY))
-            found.append(name)
-    for name in ("cwd", "root", "exe", "fd/0", "ns/mnt"):
-        with contextlib.suppress(PermissionError):
-            os.readlink(f"{folder}/{name}")
-            found.append(f"link {name}")
-    return found
-
-
-def tell_ways_into(pid):
-    """How many there are."""
-    found = ways_into(pid)
-    sys.stderr.write("".join(f"a way into the worker: {each}\n" for each in found))
-    return len(found)
-
-
 class Worker(StoresTest):
     def test_its_own_account_looks_into_it_no_more_than_anybody_else(self):
         self.set_token()
@@ -465,6 +425,21 @@ class Service(StoresTest):
         self.worker.wait()
         with self.within(3):
             self.assertEqual(self.token(), "")
+        self.start()
+        self.assertEqual(self.token(), "token")
+
+    def test_stopped_by_its_account_it_costs_each_request_its_time_and_no_more(self):
+        self.set_token()
+        other = self.client()
+        self.as_mobile(lambda: os.kill(self.worker.pid, signal.SIGSTOP))
+        for _ in range(3):
+            with self.within(2.5):
+                self.assertEqual(self.token(), "")
+            with self.within(0.1):
+                other.integer("IsVoicemailServiceSubscribed")
+        self.logs.wait_for("unified", ERROR, READ)
+        self.as_mobile(lambda: os.kill(self.worker.pid, signal.SIGCONT))
+        self.assertEqual(self.worker.wait(10), 0, "nobody waits for it any more")
         self.start()
         self.assertEqual(self.token(), "token")
 
