@@ -41,11 +41,19 @@ WorkerResult waitForMessage(int fd, Clock::time_point deadline) noexcept {
   }
 }
 
+// What waits to be closed: descriptors of four messages at most, and channels that nobody reads any more.
+constexpr std::size_t kMostToClose = 4 * (kMostOnTheWay + 3);
+constexpr std::size_t kRoomForChannels = 256;
+
 // See docs/decisions/11-door.md. Never destroyed: a thread of it may be stuck at the end of the process.
+ClosingLine& closingLine() {
+  static ClosingLine* const line = new ClosingLine(kMostToClose);
+  return *line;
+}
+
 void closeElsewhere(UniqueFd descriptor) noexcept {
   try {
-    static ClosingLine* const line = new ClosingLine;
-    line->close(std::move(descriptor), ClosingLine::kClients);
+    closingLine().close(std::move(descriptor), ClosingLine::kClients);
   } catch (const std::bad_alloc&) {  // then here
   }
 }
@@ -65,6 +73,14 @@ bool isEmpty(int socket) noexcept {
 }
 
 }  // namespace
+
+bool WorkerChannel::hasRoomToDistrust() noexcept {
+  try {
+    return closingLine().hasRoomFor(kMostOnTheWay + kRoomForChannels);
+  } catch (const std::bad_alloc&) {
+    return false;
+  }
+}
 
 WorkerChannel& WorkerChannel::operator=(WorkerChannel&& other) noexcept {
   close();
@@ -165,6 +181,7 @@ WorkerResult WorkerChannel::receive(WorkerMessage* message, Clock::time_point de
       if (const WorkerResult waited = waitForMessage(socket_.get(), deadline); waited != WorkerResult::done)
         return waited;
     }
+    if (isDistrusted_ && !hasRoomToDistrust()) return WorkerResult::unavailable;
     in = {};
     in.msg_iov = pieces.data();
     in.msg_iovlen = pieces.size();

@@ -38,8 +38,11 @@ class WorkerChannel {
   bool isOpen() const noexcept { return socket_.isValid(); }
   void close() noexcept;
   // The other end may be hostile: what it sends are perhaps descriptors whose last close waits for as long as
-  // it likes. Those that arrive unread, or with what is no message, are closed on another thread.
+  // it likes. Those that arrive unread, or with what is no message, are closed on another thread. While
+  // too many wait for that, receive() says `unavailable`, and the message stays where it is.
   void distrust() noexcept { isDistrusted_ = true; }
+  // Whether receive() would not say so.
+  static bool hasRoomToDistrust() noexcept;
   // Does the same with what came along with a message and was not asked for.
   void discard(WorkerMessage* message) noexcept;
   // Gives the socket away.

@@ -28,7 +28,7 @@ enum class WorkerResult {
   full,         // the other end does not read
   malformed,    // what came, or what was to be sent, has not the form of a message
   outOfMemory,  // of memory or of descriptors, in this process
-  unavailable,  // there is no worker
+  unavailable,  // there is no worker, or none that can be listened to
 };
 
 }  // namespace brenvik

@@ -9,7 +9,8 @@ import re
 import signal
 import time
 
-from harness import ERROR, LOG_ERR, SANITIZED, HelperTest, eventually, main
+from harness import ERROR, LOG_ERR, SANITIZED, HelperTest, as_account, eventually, main
+from intrusion import tell_ways_into
 from test_lasd import ALL, DIRECTORY, HOST, UpdateTest, request_check
 from test_location import Brenvik, LocationTest, civic
 import test_heartbeat
@@ -67,6 +68,13 @@ class Updates(WorkerTest, UpdateTest):
         self.assertEqual(strange, [])
         ours = {os.readlink(f"/proc/{self.daemon.pid}/fd/{number}") for number in os.listdir(f"/proc/{self.daemon.pid}/fd")}
         self.assertEqual([link for link in links if link.startswith("socket:") and link in ours], [])
+
+    def test_its_own_account_looks_into_it_no_more_than_anybody_else(self):
+        self.serve({"gsm": "1"})
+        self.assertEqual(self.check(), ["UpdateAvailable gsm"])
+        worker = self.daemon.network_worker()
+        self.assertEqual(as_account("nobody", lambda: tell_ways_into(worker)), 0)
+        self.assertEqual(self.daemon.network_worker(), worker)
 
     def test_the_daemon_has_no_socket_to_the_network(self):
         self.serve({"gsm": "1"})

@@ -15,6 +15,7 @@ import time
 
 import wire
 from harness import BUILD, ERROR, HelperTest, as_account, eventually, listen, main
+from intrusion import tell_ways_into, ways_into
 
 HOME = pathlib.Path("/var/mobile")
 LIBRARY = HOME / "Library"
@@ -290,6 +291,16 @@ class Places(StoresTest):
 
 
 class Worker(StoresTest):
+    def test_its_own_account_looks_into_it_no_more_than_anybody_else(self):
+        self.set_token()
+        worker, = self.workers()
+        own = subprocess.Popen(["/bin/sleep", "60"], user=MOBILE.pw_uid, group=MOBILE.pw_gid, extra_groups=[])
+        self.addCleanup(own.wait)
+        self.addCleanup(own.kill)
+        self.assertEqual(as_account("mobile", lambda: int("mem" in ways_into(own.pid))), 1, "these are ways")
+        self.assertEqual(as_account("mobile", lambda: tell_ways_into(worker)), 0)
+        self.assertEqual(self.token(), "token")
+
     def status(self, pid):
         lines = pathlib.Path(f"/proc/{pid}/status").read_text().splitlines()
         return dict(line.split(":\t", 1) for line in lines if ":\t" in line)
@@ -416,12 +427,32 @@ class Service(StoresTest):
         self.daemon.wait()
         self.assertEqual(self.worker.wait(10), 0)
 
+    def test_its_own_account_looks_into_it_no_more_than_anybody_else(self):
+        self.set_token()
+        self.assertEqual(as_account("mobile", lambda: tell_ways_into(self.worker.pid)), 0)
+        self.assertEqual(self.token(), "token")
+
     def test_while_none_is_started_an_operation_fails_in_time_and_the_next_one_has_the_new_one(self):
         self.set_token()
         self.worker.kill()
         self.worker.wait()
         with self.within(3):
             self.assertEqual(self.token(), "")
+        self.start()
+        self.assertEqual(self.token(), "token")
+
+    def test_stopped_by_its_account_it_costs_each_request_its_time_and_no_more(self):
+        self.set_token()
+        other = self.client()
+        self.as_mobile(lambda: os.kill(self.worker.pid, signal.SIGSTOP))
+        for _ in range(3):
+            with self.within(2.5):
+                self.assertEqual(self.token(), "")
+            with self.within(0.1):
+                other.integer("IsVoicemailServiceSubscribed")
+        self.logs.wait_for("unified", ERROR, READ)
+        self.as_mobile(lambda: os.kill(self.worker.pid, signal.SIGCONT))
+        self.assertEqual(self.worker.wait(10), 0, "nobody waits for it any more")
         self.start()
         self.assertEqual(self.token(), "token")
 

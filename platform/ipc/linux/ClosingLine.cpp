@@ -75,6 +75,7 @@ struct Job {
 }  // namespace
 
 struct ClosingLine::State {
+  explicit State(std::size_t most) noexcept : capacity(most) {}
   bool push(Job&& job) noexcept;
   void startThread(const std::shared_ptr<State>& self) noexcept;
   void work();
@@ -97,6 +98,7 @@ struct ClosingLine::State {
     return false;
   }
 
+  const std::size_t capacity;
   mutable std::mutex mutex;
   std::condition_variable jobCame;
   std::condition_variable jobDone;
@@ -108,7 +110,7 @@ struct ClosingLine::State {
   bool stopping = false;
 };
 
-ClosingLine::ClosingLine() : state_(std::make_shared<State>()) {}
+ClosingLine::ClosingLine(std::size_t capacity) : state_(std::make_shared<State>(capacity)) {}
 
 ClosingLine::~ClosingLine() {
   std::unique_lock lock(state_->mutex);
@@ -119,10 +121,10 @@ ClosingLine::~ClosingLine() {
 
 bool ClosingLine::State::push(Job&& job) noexcept {
   const std::lock_guard lock(mutex);
-  if (stopping || jobs.size() >= kCapacity) return false;
+  if (stopping || jobs.size() >= capacity) return false;
   try {
     busy.reserve(kMostThreads);
-    if (job.token != 0) discarded.reserve(kCapacity + kMostThreads);  // telling must not fail
+    if (job.token != 0) discarded.reserve(capacity + kMostThreads);  // telling must not fail
     jobs.push_back(std::move(job));
   } catch (const std::bad_alloc&) {
     return false;
@@ -250,7 +252,7 @@ bool ClosingLine::discardMessage(SharedFd socket, Account account, std::uint64_t
 
 bool ClosingLine::hasRoomFor(std::size_t count) const noexcept {
   const std::lock_guard lock(state_->mutex);
-  return state_->jobs.size() + count <= kCapacity;
+  return state_->jobs.size() + count <= state_->capacity;
 }
 
 int ClosingLine::readable() const noexcept {

@@ -32,7 +32,7 @@ class ClosingLine {
   // Jobs that may wait. Whoever makes jobs for strangers asks hasRoomFor() before it lets them make more.
   static constexpr std::size_t kCapacity = 512;
 
-  ClosingLine();
+  explicit ClosingLine(std::size_t capacity = kCapacity);
   ~ClosingLine();
   ClosingLine(const ClosingLine&) = delete;
   ClosingLine& operator=(const ClosingLine&) = delete;

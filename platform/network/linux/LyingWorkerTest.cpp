@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <future>
+#include <mutex>
 #include <string>
 
 #include "platform/network/GeoMessages.h"
@@ -19,6 +20,7 @@
 #include "platform/network/linux/RemoteGunzip.h"
 #include "platform/network/linux/RemoteWebClient.h"
 #include "platform/runloop/linux/SystemQueues.h"
+#include "platform/worker/fakes/LingeringSocket.h"
 #include "platform/worker/fakes/ThreadedWorker.h"
 
 namespace brenvik {
@@ -207,6 +209,39 @@ TEST_F(LyingWorkerTest, SignsOfLifeKeepARequestAndAFloodOfThemDoesNot) {
   expectGivenUp(1);
   EXPECT_EQ(unpack(), GunzipResult::unavailable);
   expectGivenUp(2);
+}
+
+TEST_F(LyingWorkerTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
+  std::mutex mutex;
+  std::vector<UniqueFd> peers;
+  std::uint32_t kind = 0;
+  std::vector<std::byte> payload;
+  lie = [&](WorkerChannel& channel) {
+    LingeringSocket lingering;
+    WorkerMessage sent{kind, payload, one(std::move(lingering.socket))};
+    {
+      const std::lock_guard lock(mutex);
+      peers.push_back(std::move(lingering.peer));  // which takes nothing
+    }
+    EXPECT_EQ(channel.send(sent), WorkerResult::done);
+  };
+  const auto before = Clock::now();
+  int times = 0;
+  for (const auto each : {kAnswer, kAlive, number(NetworkMessage::refusal), 1000U}) {
+    kind = each;
+    EXPECT_EQ(fetch()->errorKind, WebErrorKind::clientUnavailable) << kind;
+    expectGivenUp(++times);
+    EXPECT_EQ(unpack(), GunzipResult::unavailable) << kind;
+    expectGivenUp(++times);
+    EXPECT_EQ(askForPlace(), "the network worker is not available") << kind;
+    expectGivenUp(++times);
+  }
+  kind = static_cast<std::uint32_t>(EchoMessageKind::openSocket);
+  payload = {std::byte{1}};
+  EXPECT_EQ(echo.openEchoSocket(1, 1), nullptr);
+  expectGivenUp(++times);
+  answers.shutDown();
+  EXPECT_LT(Clock::now() - before, 2s) << "each of the thirteen lingers so long";
 }
 
 TEST_F(LyingWorkerTest, ARefusalEndsTheQuestionAndNotTheWorker) {

@@ -14,6 +14,8 @@
 #include <thread>
 #include <utility>
 
+#include "platform/base/SealedMemory.h"
+
 namespace brenvik {
 namespace {
 
@@ -24,6 +26,9 @@ constexpr const char kQueueLabel[] = "network worker";
 // Signs of life within one longest silence; a correct worker gives six. More are a flood.
 constexpr int kMostSignsOfLife = 60;
 constexpr auto kTimerLeeway = milliseconds(100);
+
+// What comes along with an answer is sealed memory; of anything else the last close could wait for ever.
+bool isSealedMemory(const UniqueFd& descriptor) noexcept { return sizeOfSealedMemory(descriptor.get()) >= 0; }
 
 struct Question {
   NetworkWork work{};
@@ -172,6 +177,12 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
         return end(at, Ended::refused, nullptr);
       default:  // hung up, or nonsense
         return giveUp(at);
+    }
+    const bool isAnswer = message.kind == static_cast<std::uint32_t>(NetworkMessage::answer);
+    if (!message.descriptors.empty() &&
+        !(isAnswer && std::all_of(message.descriptors.begin(), message.descriptors.end(), isSealedMemory))) {
+      at->channel.discard(&message);
+      return giveUp(at);
     }
     switch (static_cast<NetworkMessage>(message.kind)) {
       case NetworkMessage::alive:

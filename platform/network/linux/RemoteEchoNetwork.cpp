@@ -44,6 +44,7 @@ class Conversation {
         return {};
       }
     }
+    channel_.discard(&answer);
     if (result == WorkerResult::outOfMemory) {
       channel_.close();
     } else {

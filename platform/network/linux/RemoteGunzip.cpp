@@ -76,12 +76,14 @@ GunzipOutcome RemoteGunzip::gunzipInto(const GunzipInput& input, int file, std::
     result = channel.receive(&answer, Clock::now());
     if (result == WorkerResult::outOfMemory) return {GunzipResult::outOfMemory, 0, 0};
     if (result != WorkerResult::done) break;
+    if (!answer.descriptors.empty()) {
+      channel.discard(&answer);
+      break;
+    }
     if (answer.kind == static_cast<std::uint32_t>(NetworkMessage::refusal))
       return {GunzipResult::outOfMemory, 0, 0};
     if (answer.kind == static_cast<std::uint32_t>(NetworkMessage::answer)) {
-      if (const auto outcome = decodeGunzipOutcome(answer.payload, question);
-          outcome && answer.descriptors.empty())
-        return *outcome;
+      if (const auto outcome = decodeGunzipOutcome(answer.payload, question)) return *outcome;
       break;
     }
     if (answer.kind != static_cast<std::uint32_t>(NetworkMessage::alive) || !answer.payload.empty()) break;

@@ -37,6 +37,7 @@ class ThreadedWorker final : public Worker {
     WorkerChannel theirs;
     if (const auto made = WorkerChannel::makePair(channel, &theirs); made != WorkerResult::done) return made;
     channel->setGeneration(generation_);
+    channel->distrust();
     sockets_.emplace_back(::fcntl(theirs.descriptor(), F_DUPFD_CLOEXEC, 0));
     threads_.emplace_back([this, work, theirs = std::move(theirs), copy = sockets_.back().get()]() mutable {
       serve_(work, std::move(theirs));

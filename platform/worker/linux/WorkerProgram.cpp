@@ -72,6 +72,13 @@ bool WorkerProgram::mayLog() noexcept {
 
 WorkerResult WorkerProgram::open(std::uint32_t work, WorkerChannel* channel) noexcept {
   channel->close();
+  if (!WorkerChannel::hasRoomToDistrust()) {
+    const std::lock_guard lock(mutex_);
+    if (mayLog())
+      logUnified(LogLevel::error, "%s is not asked: too much of what workers sent cannot be closed",
+                 description_.program.c_str());
+    return WorkerResult::unavailable;
+  }
   WorkerChannel ours;
   WorkerChannel theirs;
   if (const WorkerResult made = WorkerChannel::makePair(&ours, &theirs); made != WorkerResult::done)
@@ -146,7 +153,9 @@ WorkerResult WorkerProgram::reach() {
   std::erase_if(dying_, [](const Child& child) { return isReaped(child, milliseconds(0)); });
   WorkerResult reached = connectToService();
   if (reached == WorkerResult::closed) reached = startChild();
-  if (reached == WorkerResult::done) ++generation_;
+  if (reached != WorkerResult::done) return reached;
+  connection_.distrust();
+  ++generation_;
   return reached;
 }
 
@@ -202,7 +211,8 @@ WorkerResult WorkerProgram::startChild() {
 }
 
 // With its end of the connection as standard input, and no other descriptor of this process than standard
-// error.
+// error. That may be a terminal, so the worker has a session of its own: whoever has a terminal as its
+// session's can type into it. Nor has it this process's folder, to which it could not walk by itself.
 int WorkerProgram::start(const std::string& path, int theirs) {
   posix_spawn_file_actions_t actions;
   posix_spawnattr_t attributes;
@@ -221,12 +231,13 @@ int WorkerProgram::start(const std::string& path, int theirs) {
   int error = ::posix_spawn_file_actions_adddup2(&actions, theirs, STDIN_FILENO);
   if (error == 0)
     error = ::posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
+  if (error == 0) error = ::posix_spawn_file_actions_addchdir_np(&actions, "/");
   if (error == 0) error = ::posix_spawn_file_actions_addclosefrom_np(&actions, STDERR_FILENO + 1);
   if (error == 0) error = ::posix_spawnattr_setsigdefault(&attributes, &all);
   if (error == 0) error = ::posix_spawnattr_setsigmask(&attributes, &none);
   if (error == 0) {
-    error = ::posix_spawnattr_setflags(&attributes,
-                                       static_cast<short>(POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETSIGMASK));
+    constexpr int kFlags = POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSID;
+    error = ::posix_spawnattr_setflags(&attributes, static_cast<short>(kFlags));
   }
   pid_t pid = -1;
   if (error == 0) error = ::posix_spawn(&pid, path.c_str(), &actions, &attributes, arguments, environment);

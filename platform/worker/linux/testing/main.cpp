@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <filesystem>
 #include <fstream>
 #include <string>
 #include <thread>
@@ -65,6 +66,8 @@ void report(WorkerChannel& channel) {
                         .u32(socketError(AF_INET))
                         .u32(socketError(AF_NETLINK))
                         .u32(socketError(AF_UNIX))
+                        .boolean(::getsid(0) == ::getpid())
+                        .text(std::filesystem::current_path().string())
                         .take();
   (void)channel.send(message);
 }
