@@ -172,7 +172,7 @@ TEST_P(DistrustedChannelTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
     more.payload.resize(1);
     const int fd = sent.descriptors[0].get();
     (void)receiveNow(other);
-    other.discard(&message);
+    message.descriptors.clear();  // here, and not elsewhere and later: the next close is the last
     char byte = 0;
     iovec io{&byte, 1};
     alignas(cmsghdr) char control[CMSG_SPACE(sizeof fd)] = {};
