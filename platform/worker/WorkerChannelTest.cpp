@@ -13,7 +13,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/worker/fakes/LingeringSocket.h"
+#include "platform/base/fakes/LingeringSocket.h"
 #include "platform/worker/fakes/ThreadedWorker.h"
 
 namespace brenvik {
@@ -159,7 +159,7 @@ TEST_F(WorkerChannelTest, WithoutDescriptorsTheyAreALackOfThisProcess) {
 class DistrustedChannelTest : public WorkerChannelTest, public testing::WithParamInterface<int> {};
 
 TEST_P(DistrustedChannelTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
-  LingeringSocket lingering;
+  LingeringSocket lingering(2);
   other.distrust();
   WorkerMessage sent;
   sent.descriptors.push_back(std::move(lingering.socket));

@@ -21,10 +21,10 @@
 #include <vector>
 
 #include "platform/base/ProcessFacts.h"
+#include "platform/base/fakes/LingeringSocket.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/worker/WorkerFields.h"
-#include "platform/worker/fakes/LingeringSocket.h"
 #include "platform/worker/linux/SealedMemory.h"
 #include "platform/worker/linux/WorkerHost.h"
 #include "testing/Works.h"
@@ -187,7 +187,7 @@ TEST_F(WorkerProgramTest, WhatAWorkerSendsIsClosedWhereNobodyWaitsForIt) {
   WorkerProgram worker(description());
   WorkerChannel channel;
   ASSERT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::done);
-  LingeringSocket lingering;
+  LingeringSocket lingering(2);
   WorkerMessage sent;
   sent.descriptors.push_back(std::move(lingering.socket));
   ASSERT_EQ(channel.send(sent), WorkerResult::done);
