@@ -4,6 +4,7 @@
 #include <poll.h>
 #include <pthread.h>
 #include <sys/mman.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -400,6 +401,47 @@ TEST_F(BegunCallsTest, ACallIsSentAgainOnceAtMost) {
   EXPECT_EQ(codeOfNext(client(), beginClear()), 7);
 }
 
+TEST_F(BegunCallsTest, ACallThatFindsTwoChannelsClosedIsNotSentToAThird) {
+  serve([](Script& script) {
+    const auto checkIn = [&script](const auto& whileClosing) {
+      const UniqueFd connection = script.accept();
+      const Message request = script.receive(connection);
+      int ends[2];
+      ASSERT_EQ(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends), 0);
+      UniqueFd ours(ends[0]);
+      const UniqueFd theirs(ends[1]);
+      whileClosing(ours);
+      script.send(connection, checkInReply(request), {theirs.get()});
+      if (ours.isValid()) answer(script, ours, 7);
+    };
+    for (int i = 0; i < 2; ++i) checkIn([](UniqueFd& ours) { ours.reset(); });
+    checkIn([](UniqueFd&) {});
+  });
+  bvmh_call connect = 0;
+  ASSERT_EQ(bvmh_begin_connect(client(), nullptr, &connect), BVMH_OK);
+  const bvmh_call call = beginClear();
+  EXPECT_EQ(codeOfNext(client(), connect), BVMH_OK);
+  EXPECT_EQ(codeOfNext(client(), call), BVMH_ERROR_HELPER_GONE);
+  EXPECT_EQ(codeOfNext(client(), beginClear()), 7);
+}
+
+TEST_F(BegunCallsTest, ACheckInThatOnlyACancelledCallWaitedForEndsAtOnce) {
+  serve([](Script& script) {
+    const UniqueFd connection = script.accept();
+    (void)script.receive(connection);
+    script.expectEnd(connection);
+  });
+  const std::size_t before = openDescriptors();
+  bvmh_call connect = 0;
+  ASSERT_EQ(bvmh_begin_connect(client(), nullptr, &connect), BVMH_OK);
+  const bvmh_call call = beginClear();
+  EXPECT_EQ(bvmh_process(client()), BVMH_OK);
+  EXPECT_EQ(bvmh_cancel(client(), connect), BVMH_OK);
+  EXPECT_EQ(bvmh_cancel(client(), call), BVMH_OK);
+  helper_.reset();  // its script has seen the end
+  EXPECT_LT(openDescriptors(), before) << "the helper's own socket is gone, and the client has none";
+}
+
 TEST_F(BegunCallsTest, AnAnswerThatBreaksTheProtocolEndsTheChannelAndNotTheClient) {
   struct Lie {
     const char* name;
@@ -753,6 +795,9 @@ TEST_F(InterruptTest, ASignalHandlerEndsACallThatWaits) {
   ASSERT_EQ(::sigaction(SIGUSR1, &action, &before), 0);
   EXPECT_EQ(BVMobileHelperClearVoicemailToken(client()), BVMH_ERROR_INTERRUPTED);
   ::sigaction(SIGUSR1, &before, nullptr);
+  // The channel has been given up by now, and the client does not take it for one.
+  helper_.reset();
+  EXPECT_EQ(bvmh_connect(client()), BVMH_ERROR_UNREACHABLE);
 }
 
 TEST_F(InterruptTest, WithoutACallTheNextOneReturnsAndNothingIsSent) {

@@ -15,6 +15,7 @@
 #include "platform/geo/fakes/ManualGeoService.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/net/fakes/FakeEchoNetwork.h"
+#include "platform/network/EchoMessages.h"
 #include "platform/network/linux/NetworkAnswers.h"
 #include "platform/network/linux/RemoteEchoNetwork.h"
 #include "platform/network/linux/RemoteGeoService.h"
@@ -479,6 +480,22 @@ TEST_F(NetworkServingTest, QuestionsThatAreNoneCloseTheirChannelAndTheWorkerGoes
   }
   web.answer(kUrl, 200, "body");
   EXPECT_EQ(textOf(fetch()->body), "body");
+}
+
+TEST_F(NetworkServingTest, MoreThanTheLongestEchoIsNotReceivedInto) {
+  for (const auto& [largest, expected] :
+       {std::pair{kLongestEcho, WorkerResult::done}, std::pair{kLongestEcho + 1, WorkerResult::closed}}) {
+    WorkerChannel channel;
+    ASSERT_EQ(worker.open(static_cast<std::uint32_t>(NetworkWork::echo), &channel), WorkerResult::done);
+    const auto ask = [&](EchoMessageKind kind, std::vector<std::byte> payload) {
+      (void)channel.send({static_cast<std::uint32_t>(kind), std::move(payload), {}});
+      WorkerMessage message;
+      return channel.receive(&message, std::chrono::steady_clock::now() + 5s);
+    };
+    ASSERT_EQ(ask(EchoMessageKind::openSocket, encodeSocket(1, 1)), WorkerResult::done);
+    echo.arrivals.push_back({1ms, std::vector<std::byte>(60, std::byte{9})});
+    EXPECT_EQ(ask(EchoMessageKind::receive, encodeNumber(static_cast<std::uint32_t>(largest))), expected);
+  }
 }
 
 TEST_F(NetworkServingTest, ChannelsBeyondTheMostAreRefused) {

@@ -382,6 +382,10 @@ TEST_F(LinuxFileManagerTest, ATreeDeeperThanTheProcessHasDescriptorsIsCopiedList
   }
   ASSERT_EQ(::symlinkat("bottom", fd, "end"), 0);
   ::close(fd);
+  rlimit usual{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &usual), 0);
+  const rlimit few{256, usual.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &few), 0);
   EXPECT_EQ(copy("deep", "copy"), kSuccess);
   struct Counter final : ItemVisitor {
     int count = 0;
@@ -397,6 +401,7 @@ TEST_F(LinuxFileManagerTest, ATreeDeeperThanTheProcessHasDescriptorsIsCopiedList
   EXPECT_EQ(counter.last, "end");
   EXPECT_EQ(files.removeItem(dir / "deep"), kSuccess);
   EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &usual), 0);
   EXPECT_TRUE(names("").empty());
 }
 
@@ -716,6 +721,13 @@ TEST_F(LeftoversTest, WhatAStrangerMadeUnderSuchANameIsNeverRemoved) {
     dir.file(plant(".brenvik-0123456789abcde3") + "/new", "another account's");
     closed(planted.back());
     ASSERT_EQ(::chown((dir / planted.back()).c_str(), 4711, 4711), 0);
+    // A link that says of itself that it is ours, as anybody can work out.
+    std::uint64_t hash = 0xcbf29ce484222325 ^ 0x01234567;
+    for (const char c : std::string("target")) hash = (hash ^ static_cast<unsigned char>(c)) * 0x100000001b3;
+    (void)std::snprintf(name, sizeof name, ".brenvik-%016llx-01234567",
+                        static_cast<unsigned long long>(hash));
+    dir.link(plant(name), "target");
+    ASSERT_EQ(::lchown((dir / planted.back()).c_str(), 4711, 4711), 0);
   }
   EXPECT_EQ(copy("tree", "to/copy"), kSuccess);
   EXPECT_EQ(copy("tree/file", "to/copied"), kSuccess);

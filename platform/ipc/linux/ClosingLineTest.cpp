@@ -14,6 +14,7 @@
 #include <cstring>
 #include <thread>
 
+#include "platform/base/fakes/LingeringSocket.h"
 #include "platform/ipc/linux/IncomingMessage.h"
 #include "platform/ipc/linux/SystemPortSpace.h"
 
@@ -50,33 +51,6 @@ bool send(const UniqueFd& socket, int descriptor, std::size_t bytes = 1) {
   std::memcpy(CMSG_DATA(item), &descriptor, sizeof descriptor);
   return ::sendmsg(socket.get(), &message, 0) == static_cast<ssize_t>(bytes);
 }
-
-// A TCP socket whose last close waits an hour: what it has sent is never read.
-struct Lingering {
-  UniqueFd listening{::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
-  UniqueFd socket{::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0)};
-
-  Lingering() {
-    const int small = 1;
-    ::setsockopt(listening.get(), SOL_SOCKET, SO_RCVBUF, &small, sizeof small);
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t size = sizeof address;
-    auto* const raw = reinterpret_cast<sockaddr*>(&address);
-    EXPECT_EQ(::bind(listening.get(), raw, size), 0);
-    EXPECT_EQ(::listen(listening.get(), 1), 0);
-    EXPECT_EQ(::getsockname(listening.get(), raw, &size), 0);
-    (void)::connect(socket.get(), raw, size);
-    pollfd connected{socket.get(), POLLOUT, 0};
-    EXPECT_EQ(::poll(&connected, 1, 10'000), 1);
-    const linger hour{1, 3600};
-    EXPECT_EQ(::setsockopt(socket.get(), SOL_SOCKET, SO_LINGER, &hour, sizeof hour), 0);
-    const std::vector<char> block(65536);
-    while (::send(socket.get(), block.data(), block.size(), MSG_DONTWAIT | MSG_NOSIGNAL) > 0) {
-    }
-  }
-};
 
 TEST(ClosingLineTest, ClosesWhatItIsGiven) {
   ClosingLine line;
@@ -119,8 +93,8 @@ TEST(ClosingLineTest, ASocketThatLingersForAnHourHoldsUpNobody) {
   ClosingLine line;
   const auto started = Clock::now();
   auto [kept, given] = pair();
-  Lingering direct;
-  Lingering inside;
+  LingeringSocket direct;
+  LingeringSocket inside;
   auto [sender, receiver] = pair();
   ASSERT_TRUE(send(sender, inside.socket.get()));
   inside.socket.reset();
@@ -137,7 +111,7 @@ TEST(ClosingLineTest, AnAccountsNextJobWaitsForItsFirstAndKeepsNoThread) {
   ClosingLine line;
   const auto started = Clock::now();
   auto [kept, given] = pair();
-  Lingering first;
+  LingeringSocket first;
   const int number = first.socket.get();
   line.close(std::move(first.socket), 1);
   while (::fcntl(number, F_GETFD) >= 0) std::this_thread::yield();  // the number goes before the waiting
@@ -162,10 +136,10 @@ TEST(ClosingLineTest, AFullLineTakesNoMoreAndClosesOnTheCallersThread) {
 
 TEST(ClosingLineTest, TwoAccountsThatComeBeforeTheFirstThreadRunsHaveAThreadEach) {
   ClosingLine line;
-  std::array<Lingering, 8> busy;  // 100 ms each
+  std::array<LingeringSocket, 8> busy;  // 100 ms each
   auto [first, lastOfFirst] = pair();
   auto [second, ofSecond] = pair();
-  for (Lingering& each : busy) line.close(std::move(each.socket), 1);
+  for (LingeringSocket& each : busy) line.close(std::move(each.socket), 1);
   line.close(std::move(lastOfFirst), 1);
   line.close(std::move(ofSecond), 2);
   while (!hasHungUp(second)) std::this_thread::yield();
@@ -176,8 +150,8 @@ TEST(ClosingLineTest, TwoAccountsThatComeBeforeTheFirstThreadRunsHaveAThreadEach
 TEST(ClosingLineTest, WhatAStrangerSendsWithAnEmptyMessageWaitsForNothingOfTheClients) {
   SystemPortSpace ports;
   IncomingMessage incoming(ports);
-  std::array<Lingering, 8> busy;  // 100 ms each
-  for (Lingering& each : busy) ports.closing().close(std::move(each.socket), ClosingLine::kClients);
+  std::array<LingeringSocket, 8> busy;  // 100 ms each
+  for (LingeringSocket& each : busy) ports.closing().close(std::move(each.socket), ClosingLine::kClients);
   auto [clients, last] = pair();
   ports.closing().close(std::move(last), ClosingLine::kClients);
 

@@ -19,6 +19,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/base/fakes/LingeringSocket.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
 
@@ -223,6 +224,21 @@ TEST_F(StatusSocketTest, WhatAPeerSentIsNotReadAndStaysNowhere) {
   serve();
   ports.closing().drain();
   EXPECT_EQ(descriptors(), before + 2) << "the test's own two";
+}
+
+TEST_F(StatusSocketTest, WhileTheClosingLineHasNoRoomNobodyIsTaken) {
+  make();
+  std::array<LingeringSocket, 8> busy;  // 100 ms each
+  for (LingeringSocket& each : busy) ports.closing().close(std::move(each.socket), ClosingLine::kClients);
+  for (std::size_t i = 0; i < ClosingLine::kCapacity / 4; ++i)
+    ports.closing().close(UniqueFd(::dup(STDERR_FILENO)), ClosingLine::kClients);
+  const UniqueFd end = connect();
+  serve();
+  EXPECT_EQ(received(end), "nothing");
+  EXPECT_FALSE(isWatched()) << "and the loop is left in peace";
+  ports.closing().drain();
+  clock.advance(50ms);
+  EXPECT_EQ(received(end), answer);
 }
 
 TEST_F(StatusSocketTest, WithoutDescriptorsItWaitsAndDoesNotTurnInACircle) {

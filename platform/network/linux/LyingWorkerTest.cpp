@@ -6,10 +6,13 @@
 #include <sys/mman.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <cerrno>
 #include <future>
 #include <mutex>
 #include <string>
 
+#include "platform/network/EchoMessages.h"
 #include "platform/network/GeoMessages.h"
 #include "platform/network/GunzipMessages.h"
 #include "platform/network/WebMessages.h"
@@ -20,7 +23,7 @@
 #include "platform/network/linux/RemoteGunzip.h"
 #include "platform/network/linux/RemoteWebClient.h"
 #include "platform/runloop/linux/SystemQueues.h"
-#include "platform/worker/fakes/LingeringSocket.h"
+#include "platform/base/fakes/LingeringSocket.h"
 #include "platform/worker/fakes/ThreadedWorker.h"
 
 namespace brenvik {
@@ -44,6 +47,9 @@ UniqueFd memoryWith(const std::string& text, Sealed sealed = Sealed::yes) {
   const bool isDone = sealed == Sealed::no || sealMemory(memory.get());
   EXPECT_TRUE(isDone);
   return memory;
+}
+std::string textOf(const std::vector<std::byte>& bytes) {
+  return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
 }
 std::vector<UniqueFd> one(UniqueFd fd) {
   std::vector<UniqueFd> descriptors;
@@ -147,6 +153,17 @@ TEST_F(LyingWorkerTest, AnAnswerAboutABodyThatIsNotThereOrNotSealedOrOfAnotherSi
         return WorkerMessage{
             kAnswer, {std::byte{1}}, one(memoryWith(std::string(kLongestLargePayload + 1, 'x')))};
       },
+      // Answers that are good, but for the way they travel.
+      [&] {
+        const WebAnswer longer{WebErrorKind::none, 200, {{"x", std::string(kLongestLargePayload, 'x')}}, 0};
+        return WorkerMessage{kAnswer, {std::byte{1}}, one(memoryWith(textOf(encode(longer))))};
+      },
+      [&] {
+        return WorkerMessage{kAnswer, {std::byte{1}, std::byte{1}}, one(memoryWith(textOf(told(0))))};
+      },
+      [&] {
+        return WorkerMessage{kAnswer, {std::byte{1}}, one(memoryWith(textOf(told(0)), Sealed::no))};
+      },
       [&] {
         return WorkerMessage{kAnswer, {std::byte{2}}, {}};
       },
@@ -217,11 +234,11 @@ TEST_F(LyingWorkerTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
   std::uint32_t kind = 0;
   std::vector<std::byte> payload;
   lie = [&](WorkerChannel& channel) {
-    LingeringSocket lingering;
+    LingeringSocket lingering(2);
     WorkerMessage sent{kind, payload, one(std::move(lingering.socket))};
     {
       const std::lock_guard lock(mutex);
-      peers.push_back(std::move(lingering.peer));  // which takes nothing
+      peers.push_back(std::move(lingering.listening));  // whose peer takes nothing
     }
     EXPECT_EQ(channel.send(sent), WorkerResult::done);
   };
@@ -242,6 +259,48 @@ TEST_F(LyingWorkerTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
   expectGivenUp(++times);
   answers.shutDown();
   EXPECT_LT(Clock::now() - before, 2s) << "each of the thirteen lingers so long";
+}
+
+TEST_F(LyingWorkerTest, SignsOfLifeKeepNoQuestionBeyondItsLimit) {
+  lie = [](WorkerChannel& channel) {
+    for (auto sent = WorkerResult::done; sent == WorkerResult::done || sent == WorkerResult::full;) {
+      sent = channel.send({kAlive, {}, {}});
+      std::this_thread::sleep_for(kSilence / 5);
+    }
+  };
+  std::promise<NetworkAnswers::Ended> ended;
+  auto future = ended.get_future();
+  answers.ask(NetworkWork::web, {number(NetworkMessage::ask), {}, {}}, kSilence * 3,
+              [&](NetworkAnswers::Ended how, WorkerMessage*) {
+                ended.set_value(how);
+                return true;
+              });
+  const auto came = future.wait_for(10s);
+  if (came != std::future_status::ready) answers.shutDown();
+  EXPECT_EQ(came, std::future_status::ready);
+  EXPECT_EQ(future.get(), NetworkAnswers::Ended::unavailable);
+  expectGivenUp(1);
+}
+
+TEST_F(LyingWorkerTest, OfASortOfQuestionsTheWorkerHasNoMoreThanTheMost) {
+  lie = [](WorkerChannel&) {};  // it takes them all, and says nothing
+  NetworkAnswers patient(queues, worker, 1min);
+  std::atomic<std::size_t> cancelled{0};
+  const auto ask = [&](NetworkWork work) {
+    patient.ask(work, {number(NetworkMessage::ask), {}, {}}, 1min,
+                [&](NetworkAnswers::Ended how, WorkerMessage*) {
+                  if (how == NetworkAnswers::Ended::cancelled) ++cancelled;
+                  return true;
+                });
+  };
+  for (std::size_t i = 0; i < NetworkAnswers::kMostOpen + 5; ++i) ask(NetworkWork::web);
+  ask(NetworkWork::reverseGeocode);  // has its own line, and comes after them
+  for (const auto end = Clock::now() + 10s;
+       worker.opened() < static_cast<int>(NetworkAnswers::kMostOpen) + 1 && Clock::now() < end;)
+    std::this_thread::yield();
+  EXPECT_EQ(worker.opened(), static_cast<int>(NetworkAnswers::kMostOpen) + 1);
+  patient.shutDown();
+  EXPECT_EQ(cancelled, NetworkAnswers::kMostOpen + 6);
 }
 
 TEST_F(LyingWorkerTest, ARefusalEndsTheQuestionAndNotTheWorker) {
@@ -296,6 +355,31 @@ TEST_F(LyingWorkerTest, EchoAnswersOfAnotherKindOrMoreThanWasAskedForAreNone) {
   EXPECT_EQ(socket->receive(buffer).count, -1);
   expectGivenUp(1);
   EXPECT_EQ(socket->sendTo({}, buffer).error, EPIPE) << "the conversation is over";
+}
+
+TEST_F(LyingWorkerTest, NumbersThatNoKernelGivesAreNone) {
+  const auto opensAndSays = [this](std::uint32_t said) {
+    lie = [said](WorkerChannel& channel) {
+      (void)channel.send({static_cast<std::uint32_t>(EchoMessageKind::openSocket), {std::byte{1}}, {}});
+      WorkerMessage message;
+      if (channel.receive(&message, kForEver) != WorkerResult::done) return;
+      (void)channel.send({message.kind, encodeNumber(said), {}});
+    };
+    const auto socket = echo.openEchoSocket(1, 1);
+    return socket == nullptr ? -1 : socket->setReceiveTimeOut(1s);
+  };
+  EXPECT_EQ(opensAndSays(EPERM), EPERM);
+  EXPECT_EQ(opensAndSays(4096), EPIPE);
+  EXPECT_EQ(opensAndSays(0xFFFFFFFF), EPIPE);
+  const auto protocolWhenTold = [this](std::uint32_t said) {
+    answersWith([said] {
+      return WorkerMessage{
+          static_cast<std::uint32_t>(EchoMessageKind::protocolByName), encodeNumber(said), {}};
+    });
+    return echo.protocolByName("icmp");
+  };
+  EXPECT_EQ(protocolWhenTold(255), 255);
+  EXPECT_EQ(protocolWhenTold(256), std::nullopt);
 }
 
 }  // namespace

@@ -144,6 +144,16 @@ TEST_F(PreparedFolderTest, WhatIsNoPlainFileOfRootsWithOneNameStays) {
   });
 }
 
+TEST_F(PreparedFolderTest, AnAccountThatIsRootsGetsNothingThatItHasAlready) {
+  inRootsHome([&](const std::string& root) {
+    write(root + "/Library/Store/store.db");
+    ASSERT_EQ(open(folderOf(root, 0, kGroup)), State::open);
+    EXPECT_FALSE(folderOf(root, 0, kGroup).prepare(opened));
+    EXPECT_EQ(statOf(root + "/Library/Store").st_gid, 0U);
+    EXPECT_EQ(statOf(root + "/Library/Store/store.db").st_gid, 0U);
+  });
+}
+
 TEST_F(PreparedFolderTest, WhereSomebodyElseMayWriteOnTheWayNothingOfRootsIsGiven) {
   inRootsHome([&](const std::string& root) {
     const std::string store = root + "/Library/Store";
@@ -247,6 +257,11 @@ TEST_F(PreparedFolderTest, InAFolderOfTheAccountsOnlyADatabaseThatEverybodyMayRe
   ASSERT_EQ(::link(file.c_str(), (home / "other").c_str()), 0);
   EXPECT_FALSE(folderOf(home.path()).prepare(opened)) << "it has two names";
   EXPECT_EQ(ownerOf(file), 0U);
+  (void)::unlink(file.c_str());
+  write(file);
+  ASSERT_EQ(::chown(file.c_str(), 99, 99), 0);
+  EXPECT_FALSE(folderOf(home.path()).prepare(opened)) << "it is a third one's";
+  EXPECT_EQ(ownerOf(file), 99U);
   (void)::unlink(file.c_str());
   ASSERT_EQ(::mkfifo(file.c_str(), 0644), 0);
   EXPECT_FALSE(folderOf(home.path()).prepare(opened));

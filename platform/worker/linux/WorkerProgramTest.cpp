@@ -8,6 +8,7 @@
 #include <sched.h>
 #include <sys/prctl.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -24,10 +25,10 @@
 #include <vector>
 
 #include "platform/base/ProcessFacts.h"
+#include "platform/base/fakes/LingeringSocket.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/worker/WorkerFields.h"
-#include "platform/worker/fakes/LingeringSocket.h"
 #include "platform/worker/linux/SealedMemory.h"
 #include "platform/worker/linux/WorkerHost.h"
 #include "platform/worker/linux/WorkerRights.h"
@@ -149,7 +150,8 @@ TEST_F(WorkerProgramTest, TheWorkerLeavesWithItsOwner) {
 
 TEST_F(WorkerProgramTest, AWorkerHasNothingButWhatItWasGiven) {
   ::setenv("BRENVIK_LEAK", "1", 1);
-  const UniqueFd leak(::open("/dev/null", O_RDONLY));  // not closed on exec
+  std::vector<UniqueFd> leaks;  // not closed on exec
+  for (int i = 0; i < 10; ++i) leaks.emplace_back(::open("/dev/null", O_RDONLY));
   WorkerProgram worker(description());
   WorkerChannel channel;
   ASSERT_EQ(open(worker, WorkForTests::report, &channel), WorkerResult::done);
@@ -188,6 +190,50 @@ TEST_F(WorkerProgramTest, AWorkerHasNothingButWhatItWasGiven) {
     EXPECT_EQ(uid, ::getuid());
   }
   ::unsetenv("BRENVIK_LEAK");
+}
+
+TEST_F(WorkerProgramTest, SignalsAreNeitherIgnoredNorBlockedBecauseTheyAreHere) {
+  sigset_t usual;
+  sigset_t blocked;
+  ::sigemptyset(&blocked);
+  ::sigaddset(&blocked, SIGUSR2);
+  ASSERT_EQ(::pthread_sigmask(SIG_BLOCK, &blocked, &usual), 0);
+  const auto handler = std::signal(SIGUSR1, SIG_IGN);
+  WorkerProgram worker(description());
+  EXPECT_TRUE(works(worker));
+  (void)std::signal(SIGUSR1, handler);
+  ASSERT_EQ(::pthread_sigmask(SIG_SETMASK, &usual, nullptr), 0);
+  ASSERT_EQ(children().size(), 1U);
+  const auto signals = [&](const std::string& which) {
+    std::ifstream status("/proc/" + std::to_string(children()[0]) + "/status");
+    for (std::string line; std::getline(status, line);) {
+      if (line.starts_with(which)) return std::stoull(line.substr(which.size()), nullptr, 16);
+    }
+    return ~0ULL;
+  };
+  // While it starts a thread it blocks them all itself.
+  const auto isBlocked = [&] { return (signals("SigBlk:") & (1ULL << (SIGUSR2 - 1))) != 0; };
+  for (const auto end = Clock::now() + 5s; isBlocked() && Clock::now() < end;) std::this_thread::yield();
+  EXPECT_FALSE(isBlocked());
+  EXPECT_EQ(signals("SigIgn:") & (1ULL << (SIGUSR1 - 1)), 0U);
+}
+
+TEST_F(WorkerProgramTest, WhatAWorkerSendsIsClosedWhereNobodyWaitsForIt) {
+  WorkerProgram worker(description());
+  WorkerChannel channel;
+  ASSERT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::done);
+  LingeringSocket lingering(2);
+  WorkerMessage sent;
+  sent.descriptors.push_back(std::move(lingering.socket));
+  ASSERT_EQ(channel.send(sent), WorkerResult::done);
+  sent.descriptors.clear();
+  WorkerMessage back;
+  ASSERT_EQ(channel.receive(&back, Clock::now() + 20s), WorkerResult::done);
+  ASSERT_EQ(back.descriptors.size(), 1U);
+  ASSERT_TRUE(echoes(channel)) << "so it has let go of the first message";
+  const auto before = Clock::now();
+  channel.discard(&back);
+  EXPECT_LT(Clock::now() - before, 1s);
 }
 
 TEST_F(WorkerProgramTest, InANamespaceWithOneAccountThatStaysWithoutACapability) {
@@ -303,11 +349,12 @@ TEST_F(WorkerProgramTest, AProgramThatLeavesAtOnceHangsUp) {
   std::filesystem::create_symlink("/bin/true", script);
   WorkerProgram worker(description({folder.path()}));
   WorkerChannel channel;
-  // Whether it has left before the channel is sent or after is the processor's choice.
-  if (open(worker, WorkForTests::echo, &channel) == WorkerResult::done) {
+  const WorkerResult opened = open(worker, WorkForTests::echo, &channel);
+  // The second one may be gone, too, before it is sent anything.
+  if (opened == WorkerResult::done) {
     EXPECT_EQ(receive(channel), WorkerResult::closed);
   } else {
-    EXPECT_FALSE(channel.isOpen());
+    EXPECT_EQ(opened, WorkerResult::unavailable);
   }
 }
 
@@ -340,17 +387,114 @@ TEST_F(WorkerProgramTest, SealedMemoryArrivesAndMemoryThatCanChangeIsRefused) {
 class WorkerServiceTest : public WorkerProgramTest {
  protected:
   // As the service manager's socket unit does.
-  UniqueFd listen(int type = SOCK_SEQPACKET) {
+  UniqueFd listen(int type = SOCK_SEQPACKET, int backlog = 1) {
+    const sockaddr_un address = this->address();
+    UniqueFd socket(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
+    EXPECT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    EXPECT_EQ(::listen(socket.get(), backlog), 0);
+    return socket;
+  }
+  sockaddr_un address() const {
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     const std::string path = folder / kService;
     std::strcpy(address.sun_path, path.c_str());
-    UniqueFd socket(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
-    EXPECT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-    EXPECT_EQ(::listen(socket.get(), 1), 0);
-    return socket;
+    return address;
+  }
+  // As a helper does.
+  WorkerChannel connect() const {
+    const sockaddr_un address = this->address();
+    UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+    EXPECT_EQ(::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    return WorkerChannel(std::move(socket));
+  }
+  static WorkerResult openOn(WorkerChannel& connection, WorkerChannel* channel) {
+    WorkerChannel theirs;
+    EXPECT_EQ(WorkerChannel::makePair(channel, &theirs), WorkerResult::done);
+    WorkerMessage opening;
+    opening.kind = static_cast<std::uint32_t>(WorkForTests::echo);
+    opening.descriptors.push_back(theirs.release());
+    return connection.send(opening);
+  }
+  // The worker as the service manager starts it, with the listening socket.
+  pid_t startAsService(const UniqueFd& socket) {
+    const std::string path = workerProgramFolders()[0] + "/worker_for_tests";
+    const std::string names = std::string("LISTEN_FDNAMES=") + kService;
+    const pid_t child = ::fork();
+    if (child != 0) return child;
+    const std::string pid = "LISTEN_PID=" + std::to_string(::getpid());
+    char* const arguments[] = {const_cast<char*>(path.c_str()), nullptr};
+    char* const environment[] = {const_cast<char*>(pid.c_str()), const_cast<char*>("LISTEN_FDS=1"),
+                                 const_cast<char*>(names.c_str()), nullptr};
+    if (socket.get() == 3 ? ::fcntl(3, F_SETFD, 0) == 0 : ::dup2(socket.get(), 3) == 3)
+      ::execve(path.c_str(), arguments, environment);
+    ::_exit(1);
+  }
+  static void reap(pid_t child) {
+    int status = -1;
+    EXPECT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
   }
 };
+
+TEST_F(WorkerServiceTest, AServiceTakesEightConnectionsAndOneMoreWhenOneHasHungUp) {
+  if (::geteuid() != 0) GTEST_SKIP() << "a worker talks to root only";
+  const UniqueFd socket = listen(SOCK_SEQPACKET, 16);
+  const pid_t child = startAsService(socket);
+  std::vector<WorkerChannel> connections;
+  for (int i = 0; i < 8; ++i) {
+    WorkerChannel channel;
+    ASSERT_EQ(openOn(connections.emplace_back(connect()), &channel), WorkerResult::done);
+    ASSERT_TRUE(echoes(channel));
+  }
+  WorkerChannel beyond;
+  ASSERT_EQ(openOn(connections.emplace_back(connect()), &beyond), WorkerResult::done);
+  ASSERT_EQ(beyond.send({.kind = 7, .payload = {}, .descriptors = {}}), WorkerResult::done);
+  for (int i = 0; i < 20; ++i) {  // the worker has looked at everything meanwhile
+    WorkerChannel channel;
+    ASSERT_EQ(openOn(connections[0], &channel), WorkerResult::done);
+    ASSERT_TRUE(echoes(channel));
+  }
+  EXPECT_EQ(beyond.receive(&message, Clock::now()), WorkerResult::timedOut);
+  connections[3].close();
+  EXPECT_EQ(receive(beyond), WorkerResult::done);
+  EXPECT_EQ(message.kind, 7U);
+  connections.clear();
+  reap(child);
+}
+
+TEST_F(WorkerServiceTest, AServiceHangsUpOnWhoIsNotRoot) {
+  if (::geteuid() != 0 || !hasManyAccounts()) GTEST_SKIP() << "needs two accounts";
+  const UniqueFd socket = listen(SOCK_SEQPACKET, 16);
+  ASSERT_EQ(::chmod(folder.path().c_str(), 0755), 0);
+  ASSERT_EQ(::chmod((folder / kService).c_str(), 0777), 0);
+  const pid_t child = startAsService(socket);
+  WorkerChannel roots = connect();
+  ASSERT_EQ(::seteuid(65534), 0);
+  WorkerChannel stranger = connect();
+  ASSERT_EQ(::seteuid(0), 0);
+  WorkerChannel channel;
+  (void)openOn(stranger, &channel);  // it may have hung up already
+  EXPECT_EQ(receive(channel), WorkerResult::closed);
+  ASSERT_EQ(openOn(roots, &channel), WorkerResult::done);
+  EXPECT_TRUE(echoes(channel));
+  stranger.close();
+  roots.close();
+  reap(child);
+}
+
+TEST_F(WorkerServiceTest, WhoListensAndIsNotRootIsNoWorker) {
+  if (::geteuid() != 0 || !hasManyAccounts()) GTEST_SKIP() << "needs two accounts";
+  ASSERT_EQ(::chown(folder.path().c_str(), 65534, 65534), 0);
+  ASSERT_EQ(::seteuid(65534), 0);
+  const UniqueFd socket = listen();
+  ASSERT_EQ(::seteuid(0), 0);
+  WorkerProgram worker(description());
+  WorkerChannel channel;
+  EXPECT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::unavailable);
+  ASSERT_EQ(log.entries().size(), 1U);
+  EXPECT_EQ(lines()[0], "cannot connect to " + (folder / kService) + ": Permission denied");
+}
 
 TEST_F(WorkerServiceTest, WhereSomebodyListensNoProgramIsStarted) {
   const UniqueFd socket = listen();
@@ -379,7 +523,7 @@ TEST_F(WorkerServiceTest, WhereSomebodyListensNoProgramIsStarted) {
 }
 
 TEST_F(WorkerServiceTest, WhatAWorkerSendsOverTheMainConnectionKeepsNobodyWaiting) {
-  LingeringSocket lingering;
+  LingeringSocket lingering(2);
   const UniqueFd socket = listen();
   WorkerProgram worker(description());
   WorkerChannel channel;
@@ -394,7 +538,8 @@ TEST_F(WorkerServiceTest, WhatAWorkerSendsOverTheMainConnectionKeepsNobodyWaitin
 }
 
 TEST_F(WorkerServiceTest, NobodyIsAskedWhileTooMuchWaitsToBeClosed) {
-  std::vector<LingeringSocket> lingering(10);
+  std::vector<LingeringSocket> lingering;
+  for (int i = 0; i < 10; ++i) lingering.emplace_back(2);
   WorkerProgram worker(description());
   WorkerChannel ours;
   ours.distrust();
@@ -448,6 +593,14 @@ TEST(WorkerHostTest, WhatIsNoOpeningOfAChannelIsPassedOver) {
   WorkerMessage without;
   WorkerMessage noSocket;
   noSocket.descriptors.emplace_back(::open("/dev/null", O_RDWR | O_CLOEXEC));
+  WorkerMessage listening;
+  listening.descriptors.emplace_back(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+  const sockaddr_un unnamed{AF_UNIX, {}};
+  const int nobodys = listening.descriptors[0].get();
+  ASSERT_EQ(::bind(nobodys, reinterpret_cast<const sockaddr*>(&unnamed), sizeof unnamed.sun_family), 0);
+  ASSERT_EQ(::listen(nobodys, 1), 0);
+  WorkerMessage stream;
+  stream.descriptors.emplace_back(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
   WorkerMessage two;
   WorkerMessage good;
   good.kind = 5;
@@ -457,7 +610,7 @@ TEST(WorkerHostTest, WhatIsNoOpeningOfAChannelIsPassedOver) {
   two.descriptors.push_back(ends[0].release());
   two.descriptors.push_back(ends[2].release());
   good.descriptors.push_back(ends[4].release());
-  for (const WorkerMessage* each : {&without, &noSocket, &two, &good}) {
+  for (const WorkerMessage* each : {&without, &noSocket, &listening, &stream, &two, &good}) {
     ASSERT_EQ(ours.send(*each), WorkerResult::done);
   }
   ours.close();
