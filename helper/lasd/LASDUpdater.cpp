@@ -147,8 +147,7 @@ void LASDUpdater::note(std::uint32_t mask, LastCheck::Outcome outcome) noexcept 
 void LASDUpdater::noteEnd() noexcept {
   const std::lock_guard lock(checksMutex_);
   for (LastCheck& each : lastChecks_) {
-    if (each.outcome == LastCheck::Outcome::checking)
-      each = {each.type, LastCheck::Outcome::failed, now_()};
+    if (each.outcome == LastCheck::Outcome::checking) each = {each.type, LastCheck::Outcome::failed, now_()};
   }
 }
 
