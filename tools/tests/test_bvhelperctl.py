@@ -437,7 +437,7 @@ class Unusable(ToolTest):
     def test_wrong_usage_is_told_without_a_helper(self):
         (self.folder / "no.plist").write_text("no property list")
         for arguments, message in [
-            ([], "A subcommand is required"),
+            ([], "a command is required"),
             (["frobnicate"], 'unknown command "frobnicate"'),
             (["pign"], 'unknown command "pign"; did you mean "ping"?'),
             (["pref", "get"], 'unknown command "pref"; did you mean "prefs"?'),
@@ -449,7 +449,7 @@ class Unusable(ToolTest):
             (["prefs", "set", "d", "k", "v", "--type", "real", "--type=bool"], "--type is given twice"),
             (["ping", "--json=yes"], "--json takes no value"),
             (["location", "wan-ip", "--directory", "/x"], "--directory needs --wait"),
-            (["prefs"], "A subcommand is required"),
+            (["prefs"], '"prefs" needs one of these behind it: set, get, get-app, delete'),
             (["ping", "pong"], "not expected: pong"),
             (["--frob", "ping"], "not expected: --frob"),
             (["prefs", "get", "d"], "KEY is required"),
