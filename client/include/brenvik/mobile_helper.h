@@ -44,7 +44,7 @@ extern "C" {
  * built against an older 0.x or the same one run with it. */
 #define BVMH_VERSION_MAJOR 0
 #define BVMH_VERSION_MINOR 1
-#define BVMH_VERSION_PATCH 0
+#define BVMH_VERSION_PATCH 1
 #define BVMH_VERSION_NUMBER(major, minor, patch) (((major) << 16) | ((minor) << 8) | (patch))
 #define BVMH_VERSION BVMH_VERSION_NUMBER(BVMH_VERSION_MAJOR, BVMH_VERSION_MINOR, BVMH_VERSION_PATCH)
 BVMH_API uint32_t bvmh_version(void);
