@@ -813,6 +813,34 @@ class Events(ToolTest):
             self.assertEqual(program.wait(60), 0)
             self.assertEqual(list(self.folder.iterdir()), [])
 
+    def test_sockets_of_a_service_manager_are_taken_and_stay(self):
+        names = ["com.norvale.brenvik", "com.norvale.Brenvik.lasd"]
+        listening = [socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) for _ in names]
+        for sock, name in zip(listening, names):
+            self.addCleanup(sock.close)
+            sock.bind(str(self.folder / name))
+            sock.listen()
+        for command in (["bvhelperctl", "watch"], ["brenvik-standin"]):
+            first, second = (str(sock.fileno()) for sock in listening)
+            # As a service manager does: from descriptor 3 on, and for that process alone.
+            handed = ["bash", "-c", f'exec 10<&{first} 11<&{second} 3<&10 4<&11; LISTEN_PID=$$ exec "$@"', "bash",
+                      BUILD / command[0], *command[1:], "--count", "2"]
+            program = subprocess.Popen(handed, stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True,
+                                       pass_fds=[sock.fileno() for sock in listening],
+                                       env={**os.environ, "LISTEN_FDS": "2", "LISTEN_FDNAMES": ":".join(names)})
+            self.addCleanup(program.stdout.close)
+            self.addCleanup(program.stderr.close)
+            self.addCleanup(program.wait)
+            self.addCleanup(program.kill)
+            self.assertEqual(program.stderr.readline(),
+                             f"{command[0]}: listening on the sockets of the service manager\n")
+            self.send("com.norvale.brenvik", push(9100001, CIVIC)).recv(100)
+            self.assertIn("civic-info", program.stdout.readline())
+            self.send("com.norvale.Brenvik.lasd", notification(UPDATE)).close()
+            self.assertIn("notification", program.stdout.readline())
+            self.assertEqual(program.wait(60), 0)
+            self.assertEqual({each.name for each in self.folder.iterdir()}, set(names))
+
     def test_json_lines(self):
         for command in (["bvhelperctl", "watch"], ["brenvik-standin"]):
             program = self.start(*command, "--json", "--count", "2")
