@@ -883,7 +883,21 @@ class Events(ToolTest):
                               text=True, timeout=60)
         self.assertEqual(done.returncode, 1)
         self.assertEqual(done.stderr,
-                         f"bvhelperctl: cannot listen in {self.folder}: another process serves that name\n")
+                         f"bvhelperctl: cannot listen in {self.folder}: another process serves that name\n"
+                         "The telephony daemon listens there, or another program in its place: stop that one first.\n")
+
+    def test_who_may_not_write_the_folder_is_told_what_to_do(self):
+        if os.getuid() != 0:
+            self.skipTest("becoming another account needs root")
+        self.folder.chmod(0o755)
+        program = self.folder / "brenvik-standin"  # the build may stand where others cannot go
+        shutil.copy(BUILD / "brenvik-standin", program)
+        done = subprocess.run([program, "--directory", self.folder], capture_output=True, text=True, timeout=60,
+                              preexec_fn=lambda: os.setresuid(65534, 65534, 65534))
+        self.assertEqual((done.returncode, done.stderr),
+                         (1, f"brenvik-standin: cannot listen in {self.folder}: Permission denied\n"
+                             "The folder is root's. Run this as root, have a service manager hand the sockets over, or name "
+                             "another folder with --directory.\n"))
 
     def test_wrong_usage_of_the_stand_in(self):
         for arguments in (["--refuse", "0"], ["--refuse", "x"], ["--refuse", "1", "--hang"], ["--count", "0"], ["x"]):
