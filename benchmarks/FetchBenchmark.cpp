@@ -19,6 +19,7 @@
 #include "Ratios.h"
 #include "helper/lasd/HttpFetcher.h"
 #include "platform/base/UniqueFd.h"
+#include "platform/gzip/fakes/GzipOf.h"
 #include "platform/gzip/linux/ZlibGunzip.h"
 #include "platform/network/linux/NetworkAnswers.h"
 #include "platform/network/linux/RemoteWebClient.h"
@@ -190,20 +191,7 @@ void fetchIntoMemoryByCurl(benchmark::State& state) {
 
 // One gzip file, made once.
 const std::string& packed() {
-  static const std::string made = [] {
-    const std::string text = someText(kUnpackedSize);
-    z_stream stream{};
-    require(::deflateInit2(&stream, 6, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY) == Z_OK, "zlib");
-    std::string result(::deflateBound(&stream, text.size()) + 64, '\0');
-    stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
-    stream.avail_in = static_cast<uInt>(text.size());
-    stream.next_out = reinterpret_cast<Bytef*>(result.data());
-    stream.avail_out = static_cast<uInt>(result.size());
-    require(::deflate(&stream, Z_FINISH) == Z_STREAM_END, "zlib");
-    result.resize(stream.total_out);
-    ::deflateEnd(&stream);
-    return result;
-  }();
+  static const std::string made = gzipOf(someText(kUnpackedSize));
   return made;
 }
 

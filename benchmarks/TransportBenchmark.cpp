@@ -55,10 +55,10 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-constexpr double kMostOfBare = 1.20;
+constexpr double kMaxRatioToBare = 1.20;
 constexpr double kMostOfBus = 0.55;
-constexpr double kMostOfBareRegion = 1.15;
-constexpr double kMostOfBareStart = 1.35;
+constexpr double kMaxRatioToBareRegion = 1.15;
+constexpr double kMaxRatioToBareStart = 1.35;
 constexpr double kMostOfOneClient = 1.1;  // a call of one among many, beside a call of the only one
 constexpr std::size_t kManyClients = 4000;
 constexpr double kMostOfLibrary = 0.15;  // of a bare ping-pong, beside a call without the library
@@ -378,7 +378,7 @@ bool compareCalls(const std::string& daemonPath, const std::string& barePath, in
                        {{"call of the daemon, 288 bytes in, 36 out", callOf(daemon)},
                         {"bare ping-pong, 288 bytes in, 36 out", callOf(bare)},
                         {"sd-bus peer to peer, 255 characters in", [&bus] { return bus.call(); }}},
-                       {{0, 1, kMostOfBare}, {0, 2, kMostOfBus}});
+                       {{0, 1, kMaxRatioToBare}, {0, 2, kMostOfBus}});
 }
 
 // A client of the library, whose calls are refused at once: their token is no text.
@@ -488,7 +488,7 @@ bool compareRegions(const std::string& barePath, int rounds) {
           return microsecondsSince(before);
         }},
        {"bare reply of 65,536 bytes", [&] { return bare.exchange(&request, sizeof request, kBareLargest); }}},
-      {{0, 1, kMostOfBareRegion}});
+      {{0, 1, kMaxRatioToBareRegion}});
 }
 
 bool compareStarts(const std::string& daemonPath, const std::string& barePath, int rounds) {
@@ -498,7 +498,7 @@ bool compareStarts(const std::string& daemonPath, const std::string& barePath, i
   return comparePaired({.rounds = rounds, .unmeasured = 1, .measured = 15},
                        {{"start of the daemon to its first reply", startOf(daemonPath)},
                         {"start of a bare server to its first reply", startOf(barePath)}},
-                       {{0, 1, kMostOfBareStart}});
+                       {{0, 1, kMaxRatioToBareStart}});
 }
 
 // Of programs that have answered their first check-in and wait for more.

@@ -17,7 +17,7 @@ namespace brenvik {
 extern const char* const kReachabilityAddress;
 
 // Keeps the cellular data link awake: one ICMP echo request every two seconds by the interface pdp_ip0 while
-// switched on, and a busy token held for as long. What becomes of a request is told nobody.
+// switched on, and a busy token held for as long. Nobody is told whether a request was answered.
 class CellularHeartbeat {
  public:
   // What it works with; all of it outlives the heartbeat, or its shutDown().

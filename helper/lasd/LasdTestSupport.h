@@ -3,7 +3,6 @@
 #pragma once
 
 #include <gtest/gtest.h>
-#include <zlib.h>
 
 #include <filesystem>
 #include <fstream>
@@ -15,6 +14,7 @@
 #include <vector>
 
 #include "helper/lasd/HttpFetcher.h"
+#include "platform/gzip/fakes/GzipOf.h"
 #include "platform/gzip/linux/ZlibGunzip.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
@@ -22,20 +22,6 @@
 #include "platform/web/fakes/ScriptedWebClient.h"
 
 namespace brenvik {
-
-inline std::string gzipOf(const std::string& text) {
-  z_stream stream{};
-  EXPECT_EQ(::deflateInit2(&stream, 6, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY), Z_OK);
-  std::string result(::deflateBound(&stream, text.size()) + 64, '\0');
-  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
-  stream.avail_in = static_cast<uInt>(text.size());
-  stream.next_out = reinterpret_cast<Bytef*>(result.data());
-  stream.avail_out = static_cast<uInt>(result.size());
-  EXPECT_EQ(::deflate(&stream, Z_FINISH), Z_STREAM_END);
-  result.resize(stream.total_out);
-  ::deflateEnd(&stream);
-  return result;
-}
 
 inline std::string contentOf(const std::filesystem::path& path) {
   std::ifstream file(path, std::ios::binary);

@@ -74,7 +74,7 @@ struct StatusReport {
   bool operator==(const StatusReport&) const = default;
 };
 
-// The datagram. What would break a line is left out of its value; a word that is none becomes "unknown".
+// The datagram. What would break a line is left out of its value; a malformed word becomes "unknown".
 std::string writeStatus(const StatusReport& report);
 
 // Nothing when the text is no such datagram. Keys that are not known are passed over, so that a newer helper

@@ -70,7 +70,7 @@ class ReverseGeocodeTicket {
 class GeoIpTicket {
  public:
   virtual ~GeoIpTicket() = default;
-  // As above.
+  // Asks, as ReverseGeocodeTicket::submit does.
   virtual void submit(GeoIpHandler handler, const AuditToken* auditToken,
                       const GeoNetworkActivity* networkActivity,
                       const std::shared_ptr<WorkQueue>& handlerQueue) = 0;

@@ -26,7 +26,7 @@ inline constexpr std::size_t kLongestAddress = 200'000;
 
 // Nothing when it is not such a question or outcome, or one that no correct program sends: a part of an
 // address that is empty, no UTF-8 or holds a NUL, a country code of anything but two capital letters, a
-// public address that is none. All throw std::bad_alloc.
+// malformed public address. All throw std::bad_alloc.
 std::vector<std::byte> encode(const Coordinate& coordinate);
 std::optional<Coordinate> decodeCoordinate(std::span<const std::byte> payload);
 std::vector<std::byte> encode(const GeoOutcome<MapItems>& outcome);

@@ -79,7 +79,7 @@ class PreferencesStore {
   virtual bool readApplicationValue(std::string_view key, std::string_view domain,
                                     PropertyList* value) noexcept = 0;
 
-  // For whom a value that cannot be read for want of memory is as good as none.
+  // For callers that treat "out of memory" like "no value".
   PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
                          HostScope host) noexcept {
     PropertyList value;

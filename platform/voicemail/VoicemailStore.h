@@ -26,7 +26,7 @@ class VoicemailStore {
   virtual bool readToken(std::optional<std::string>* token) noexcept = 0;
   virtual bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept = 0;
 
-  // For whom a token that cannot be read for want of memory is as good as none.
+  // For callers that treat "out of memory" like "no token".
   std::optional<std::string> copyToken() noexcept {
     std::optional<std::string> token;
     return readToken(&token) ? token : std::nullopt;

@@ -47,7 +47,7 @@ class WebBody {
   // A body that another process has filled, mapped for reading. Nothing when the memory can still change, or
   // is not of exactly this size. Throws std::bad_alloc.
   static std::optional<WebBody> ofSealedMemory(UniqueFd memory, std::uint64_t size);
-  // The memory of such a one, which stays its own; of every other body -1.
+  // The memory of a body that ofSealedMemory() made, which keeps it; -1 for any other body.
   int sealedMemory() const noexcept { return form_ == Form::sealed ? memory_.get() : -1; }
 
   const std::byte* data() const noexcept { return data_; }

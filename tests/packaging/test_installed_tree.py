@@ -181,9 +181,33 @@ class InstalledTree(unittest.TestCase):
 
     def test_packages_name_what_is_loaded_at_run_time(self):
         control = (SOURCE / "debian" / "control").read_text()
-        paragraph = control[control.index("Package: brenvik-mobile-helper\n"):].split("\n\n")[0]
-        for package in ("libsqlite3-0", "libssl3", "libcurl4", "zlib1g", "ca-certificates", "netbase"):
-            self.assertIn(f"\n {package},", paragraph)
+
+        def paragraph(package):
+            return control[control.index(f"Package: {package}\n"):].split("\n\n")[0]
+
+        for package in ("libsqlite3-0", "libssl3", "libsystemd0", "ca-certificates", "netbase"):
+            self.assertIn(f"\n {package},", paragraph("brenvik-mobile-helper"))
+        self.assertIn("\n libsystemd0\n", paragraph("bvhelperctl"))
+        # What is linked is found by the package's tools, under the name that it has in that release.
+        for package in ("libcurl4", "zlib1g"):
+            self.assertNotIn(f"\n {package},", control)
+
+    def test_the_packages_and_the_programs_have_one_version(self):
+        changelog = (SOURCE / "debian" / "changelog").read_text()
+        version = re.search(r"^CMAKE_PROJECT_VERSION:\w+=(.*)$", self.cache, flags=re.M)[1]
+        self.assertEqual(re.match(r"\S+ \(([^)]+)\)", changelog)[1], version)
+
+    def test_each_package_that_is_installed_for_the_build_has_its_reason(self):
+        page = (SOURCE / "docs" / "dependencies.md").read_text().split("## Data")[0]
+        cells = [re.sub(r"\(.*?\)", "", line.split("|")[1]) for line in page.splitlines() if line.startswith("| ")]
+        named = [each for cell in cells for each in re.findall(r"[a-z][a-z0-9.+-]+", cell)]
+        setup = (SOURCE / "scripts" / "setup").read_text()
+        wanted = set(re.findall(r"[a-z][a-z0-9.+-]+", re.sub(r"#.*", "", re.search(r"packages=\((.*?)\n\)", setup, re.S)[1])))
+        wanted -= {"compiler", "libsqlite3-0"}  # a variable; run time of another
+        control = (SOURCE / "debian" / "control").read_text().split("\n\n")[0]
+        wanted |= {each for each in re.findall(r"^ ([a-z][a-z0-9.+-]+)", control, re.M) if not re.match("debhelper-|dh-sequence-", each)}
+        self.assertGreater(len(wanted), 50)
+        self.assertEqual({each: named.count(each) for each in wanted if named.count(each) != 1}, {})
 
 
 if __name__ == "__main__":

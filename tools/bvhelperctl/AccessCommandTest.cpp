@@ -150,8 +150,9 @@ TEST_F(AccessCommandTest, JsonHasTheSameStepsInOneLine) {
   EXPECT_EQ(line["caller"],
             (nlohmann::ordered_json{{"executable", program}, {"uid", 0}, {"account", "root"}, {"unit", ""}}));
   EXPECT_EQ(line["entitlement"], kAllow);
-  EXPECT_EQ(line["reason"], file.string() + " gives it as no boolean");
+  EXPECT_EQ(line["reason"], file.string() + " gives it as an integer, not a boolean");
   ASSERT_EQ(line["steps"].size(), 4U);
+  EXPECT_EQ(line["steps"][3]["text"], "has " + std::string(kAllow) + " as an integer, not a boolean");
   EXPECT_EQ(
       line["steps"][2],
       (nlohmann::ordered_json{

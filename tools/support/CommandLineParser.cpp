@@ -172,8 +172,17 @@ class Walk {
     return {"unknown command " + inQuotes(asked) + suggestion(similar)};
   }
 
+  std::string whatIsMissing() const {
+    if (line_.group.empty()) return "a command is required";
+    std::string names;
+    for (const CommandSyntax& each : program_.commands) {
+      if (line_.group == each.group) names += std::string(names.empty() ? "" : ", ") + each.name;
+    }
+    return inQuotes(line_.group) + " needs one of these behind it: " + names;
+  }
+
   void finish() const {
-    if (command() == nullptr) throw UsageError{"A subcommand is required"};
+    if (command() == nullptr) throw UsageError{whatIsMissing()};
     const std::vector<Parameter>& wanted = *command()->positionals;
     if (positionals_ < wanted.size())
       throw UsageError{std::string(wanted[positionals_].name) + " is required"};

@@ -73,8 +73,8 @@ TEST(CommandLineParserTest, WordsThatLookLikeOptionsCanBeGiven) {
 }
 
 TEST(CommandLineParserTest, MistakesAreNamed) {
-  expectRefused({}, "A subcommand is required");
-  expectRefused({"prefs"}, "A subcommand is required");
+  expectRefused({}, "a command is required");
+  expectRefused({"prefs"}, "\"prefs\" needs one of these behind it: set");
   expectRefused({"prefs", "set", "k"}, "VALUE is required");
   expectRefused({"ping", "pong"}, "not expected: pong");
   expectRefused({"--type", "a", "ping"}, "not expected: --type");

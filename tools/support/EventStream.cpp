@@ -55,7 +55,7 @@ std::string answer(StandIn& standIn, const bvmh_event& event, const EventStreamO
 
 ExitStatus cannotListen(const EventStreamOptions& options, const StandIn& standIn) {
   printFailure(options.program, options.asJson, "cannot listen " + standIn.place() + ": " + standIn.reason(),
-               "", nlohmann::ordered_json::object());
+               standIn.advice(), nlohmann::ordered_json::object());
   return ExitStatus::failed;
 }
 
@@ -93,7 +93,18 @@ bool StandIn::listen(const std::string& directory, unsigned services,
   } else {
     place_ = "on the sockets of the service manager";
   }
-  if (created != BVMH_OK) return fail(created, errno);
+  if (created != BVMH_OK) {
+    const int error = errno;
+    if (created == BVMH_ERROR_NAME_IN_USE) {
+      advice_ = "The telephony daemon listens there, or another program in its place: stop that one first.";
+    } else if (created == BVMH_ERROR_SYSTEM && (error == EACCES || error == EPERM)) {
+      advice_ =
+          "The folder is root's. Run this as root, have a service manager hand the sockets over, or name "
+          "another "
+          "folder with --directory.";
+    }
+    return fail(created, error);
+  }
   if (helperUid) bvmh_listener_allow_uid(listener_, *helperUid);
   return true;
 }

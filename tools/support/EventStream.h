@@ -45,6 +45,8 @@ class StandIn {
   // Answers a push, with 0 for success. False: nobody waits for it any more.
   bool answer(const bvmh_event& event, std::int32_t errorCode);
   const std::string& reason() const { return reason_; }
+  // What to do when listen() failed; may be empty.
+  const std::string& advice() const { return advice_; }
   // Where it listens, for people: "in /run/x".
   const std::string& place() const { return place_; }
 
@@ -54,6 +56,7 @@ class StandIn {
   bvmh_listener* listener_ = nullptr;
   UniqueFd signals_;
   std::string reason_;
+  std::string advice_;
   std::string place_;
 };
 

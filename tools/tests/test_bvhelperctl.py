@@ -437,7 +437,7 @@ class Unusable(ToolTest):
     def test_wrong_usage_is_told_without_a_helper(self):
         (self.folder / "no.plist").write_text("no property list")
         for arguments, message in [
-            ([], "A subcommand is required"),
+            ([], "a command is required"),
             (["frobnicate"], 'unknown command "frobnicate"'),
             (["pign"], 'unknown command "pign"; did you mean "ping"?'),
             (["pref", "get"], 'unknown command "pref"; did you mean "prefs"?'),
@@ -449,7 +449,7 @@ class Unusable(ToolTest):
             (["prefs", "set", "d", "k", "v", "--type", "real", "--type=bool"], "--type is given twice"),
             (["ping", "--json=yes"], "--json takes no value"),
             (["location", "wan-ip", "--directory", "/x"], "--directory needs --wait"),
-            (["prefs"], "A subcommand is required"),
+            (["prefs"], '"prefs" needs one of these behind it: set, get, get-app, delete'),
             (["ping", "pong"], "not expected: pong"),
             (["--frob", "ping"], "not expected: --frob"),
             (["prefs", "get", "d"], "KEY is required"),
@@ -813,6 +813,34 @@ class Events(ToolTest):
             self.assertEqual(program.wait(60), 0)
             self.assertEqual(list(self.folder.iterdir()), [])
 
+    def test_sockets_of_a_service_manager_are_taken_and_stay(self):
+        names = ["com.norvale.brenvik", "com.norvale.Brenvik.lasd"]
+        listening = [socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) for _ in names]
+        for sock, name in zip(listening, names):
+            self.addCleanup(sock.close)
+            sock.bind(str(self.folder / name))
+            sock.listen()
+        for command in (["bvhelperctl", "watch"], ["brenvik-standin"]):
+            first, second = (str(sock.fileno()) for sock in listening)
+            # As a service manager does: from descriptor 3 on, and for that process alone.
+            handed = ["bash", "-c", f'exec 10<&{first} 11<&{second} 3<&10 4<&11; LISTEN_PID=$$ exec "$@"', "bash",
+                      BUILD / command[0], *command[1:], "--count", "2"]
+            program = subprocess.Popen(handed, stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True,
+                                       pass_fds=[sock.fileno() for sock in listening],
+                                       env={**os.environ, "LISTEN_FDS": "2", "LISTEN_FDNAMES": ":".join(names)})
+            self.addCleanup(program.stdout.close)
+            self.addCleanup(program.stderr.close)
+            self.addCleanup(program.wait)
+            self.addCleanup(program.kill)
+            self.assertEqual(program.stderr.readline(),
+                             f"{command[0]}: listening on the sockets of the service manager\n")
+            self.send("com.norvale.brenvik", push(9100001, CIVIC)).recv(100)
+            self.assertIn("civic-info", program.stdout.readline())
+            self.send("com.norvale.Brenvik.lasd", notification(UPDATE)).close()
+            self.assertIn("notification", program.stdout.readline())
+            self.assertEqual(program.wait(60), 0)
+            self.assertEqual({each.name for each in self.folder.iterdir()}, set(names))
+
     def test_json_lines(self):
         for command in (["bvhelperctl", "watch"], ["brenvik-standin"]):
             program = self.start(*command, "--json", "--count", "2")
@@ -855,7 +883,21 @@ class Events(ToolTest):
                               text=True, timeout=60)
         self.assertEqual(done.returncode, 1)
         self.assertEqual(done.stderr,
-                         f"bvhelperctl: cannot listen in {self.folder}: another process serves that name\n")
+                         f"bvhelperctl: cannot listen in {self.folder}: another process serves that name\n"
+                         "The telephony daemon listens there, or another program in its place: stop that one first.\n")
+
+    def test_who_may_not_write_the_folder_is_told_what_to_do(self):
+        if os.getuid() != 0:
+            self.skipTest("becoming another account needs root")
+        self.folder.chmod(0o755)
+        program = self.folder / "brenvik-standin"  # the build may stand where others cannot go
+        shutil.copy(BUILD / "brenvik-standin", program)
+        done = subprocess.run([program, "--directory", self.folder], capture_output=True, text=True, timeout=60,
+                              preexec_fn=lambda: os.setresuid(65534, 65534, 65534))
+        self.assertEqual((done.returncode, done.stderr),
+                         (1, f"brenvik-standin: cannot listen in {self.folder}: Permission denied\n"
+                             "The folder is root's. Run this as root, have a service manager hand the sockets over, or name "
+                             "another folder with --directory.\n"))
 
     def test_wrong_usage_of_the_stand_in(self):
         for arguments in (["--refuse", "0"], ["--refuse", "x"], ["--refuse", "1", "--hang"], ["--count", "0"], ["x"]):

@@ -16,7 +16,7 @@
 namespace brenvik {
 
 // The network worker's side of a channel. What the helper asks for is as foreign here as an answer is there:
-// a question that is none closes its channel. Any thread.
+// a malformed question closes its channel. Any thread.
 class NetworkServing {
  public:
   // Channels that are served at a time, on a thread each: twice what the helper keeps open of any sort.

@@ -6,13 +6,13 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/mman.h>
-#include <zlib.h>
 
 #include <cerrno>
 #include <future>
 #include <string>
 
 #include "platform/geo/fakes/ManualGeoService.h"
+#include "platform/gzip/fakes/GzipOf.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/net/fakes/FakeEchoNetwork.h"
 #include "platform/network/EchoMessages.h"
@@ -267,20 +267,6 @@ TEST_F(NetworkServingTest, WhatIsUnderWayAtTheShutdownCompletesAsCancelled) {
 }
 
 // ---- gunzip -----------------------------------------------------------------------------------------------
-
-std::string gzipOf(const std::string& text) {
-  z_stream stream{};
-  EXPECT_EQ(::deflateInit2(&stream, 6, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY), Z_OK);
-  std::string result(::deflateBound(&stream, text.size()) + 64, '\0');
-  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
-  stream.avail_in = static_cast<uInt>(text.size());
-  stream.next_out = reinterpret_cast<Bytef*>(result.data());
-  stream.avail_out = static_cast<uInt>(result.size());
-  EXPECT_EQ(::deflate(&stream, Z_FINISH), Z_STREAM_END);
-  result.resize(stream.total_out);
-  ::deflateEnd(&stream);
-  return result;
-}
 
 class NetworkGunzipTest : public NetworkServingTest {
  protected:

@@ -14,8 +14,9 @@
  *
  * Threads: an object (client, listener or value) may be used by one thread at a time, any thread; different
  * objects are independent. bvmh_client_interrupt alone may be called at any time. Nothing here touches
- * signals, the working directory or the environment; SIGPIPE is never raised, every descriptor is
- * close-on-exec. After fork() only one of the two processes may go on using an object.
+ * signals or the working directory, and bvmh_listener_create_from_environment alone reads the environment.
+ * SIGPIPE is never raised, every descriptor is close-on-exec. After fork() only one of the two processes may
+ * go on using an object.
  *
  * Texts are UTF-8 and end with a NUL. Paths are read by the helper, in its own working directory and under
  * its own account: give absolute ones.
@@ -44,7 +45,7 @@ extern "C" {
  * built against an older 0.x or the same one run with it. */
 #define BVMH_VERSION_MAJOR 0
 #define BVMH_VERSION_MINOR 1
-#define BVMH_VERSION_PATCH 0
+#define BVMH_VERSION_PATCH 1
 #define BVMH_VERSION_NUMBER(major, minor, patch) (((major) << 16) | ((minor) << 8) | (patch))
 #define BVMH_VERSION BVMH_VERSION_NUMBER(BVMH_VERSION_MAJOR, BVMH_VERSION_MINOR, BVMH_VERSION_PATCH)
 BVMH_API uint32_t bvmh_version(void);

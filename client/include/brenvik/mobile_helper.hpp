@@ -310,7 +310,7 @@ class Value {
   }
   std::optional<std::chrono::system_clock::time_point> asDate() const noexcept {
     const auto seconds = got<double>(bvmh_value_get_date);
-    // What a clock of ours cannot hold is none.
+    // No date if system_clock cannot hold it.
     if (!seconds || !(*seconds > -9.2e9 && *seconds < 9.2e9)) return std::nullopt;
     return std::chrono::system_clock::time_point(
         std::chrono::duration_cast<std::chrono::system_clock::duration>(

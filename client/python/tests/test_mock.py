@@ -394,7 +394,16 @@ class Program(support.InFolder):
         process.terminate()
         self.assertEqual(process.wait(20), 1)
         self.assertEqual(process.stderr.read(), "brenvik-mobile-helper-mock: a request of CopyVoicemailToken had no rule\n"
-                         "brenvik-mobile-helper-mock: line 3: no request came for this rule\n")
+                         f"brenvik-mobile-helper-mock: {self.script}:3: no request came for this rule\n")
+
+    def test_a_dash_writes_the_lines_to_standard_output(self):
+        done = run("--log", "-", "--directory", self.folder, self.script, "--", "true", cwd=self.folder)
+        self.assertEqual((done.returncode, (self.folder / "-").exists()), (0, False), done.stderr)
+
+    def test_a_folder_that_cannot_be_made_is_named(self):
+        done = run("--directory", self.script / "below", self.script)
+        self.assertEqual((done.returncode, done.stderr),
+                         (1, f"brenvik-mobile-helper-mock: {self.script / 'below'}: Not a directory\n"))
 
     def test_help_and_version(self):
         done = run("--help")
@@ -523,7 +532,12 @@ class Recording(support.InFolder):
             Client(self.folder / "made" / _table.SERVICE).connect()
         process.terminate()
         self.assertEqual(process.wait(20), 0)
+        # Else nobody would learn which socket is missing, or that the mock is what has no entitlement.
+        told = [line.removeprefix("brenvik-mobile-helper-mock: the real helper cannot be asked: ")
+                for line in process.stderr.read().splitlines()]
         process.stderr.close()
+        self.assertEqual(told, [f"no helper answers at its socket: {self.path}: No such file or directory",
+                                "the caller lacks the entitlement com.norvale.Teravox.BrenvikHelper.allow: code 35"])
 
 
 class Completions(unittest.TestCase):

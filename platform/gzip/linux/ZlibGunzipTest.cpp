@@ -6,7 +6,6 @@
 #include <gtest/gtest.h>
 #include <sys/mman.h>
 #include <unistd.h>
-#include <zlib.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -15,25 +14,12 @@
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/gzip/fakes/GzipOf.h"
 
 namespace brenvik {
 namespace {
 
 constexpr std::uint64_t kNoLimit = std::numeric_limits<std::uint64_t>::max();
-
-std::string gzip(const std::string& text) {
-  z_stream stream{};
-  EXPECT_EQ(::deflateInit2(&stream, 6, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY), Z_OK);
-  std::string result(::deflateBound(&stream, text.size()) + 64, '\0');
-  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
-  stream.avail_in = static_cast<uInt>(text.size());
-  stream.next_out = reinterpret_cast<Bytef*>(result.data());
-  stream.avail_out = static_cast<uInt>(result.size());
-  EXPECT_EQ(::deflate(&stream, Z_FINISH), Z_STREAM_END);
-  result.resize(stream.total_out);
-  ::deflateEnd(&stream);
-  return result;
-}
 
 // Text that compresses, but not to nothing.
 std::string text(std::size_t size) {
@@ -66,19 +52,19 @@ class ZlibGunzipTest : public testing::Test {
 TEST_F(ZlibGunzipTest, AFileOfOneMemberComesOutWhole) {
   for (const std::size_t size : {0U, 1U, 1000U, 262'143U, 262'144U, 262'145U, 1'000'000U}) {
     const std::string original = text(size);
-    EXPECT_EQ(run(gzip(original)), GunzipResult::whole) << size;
+    EXPECT_EQ(run(gzipOf(original)), GunzipResult::whole) << size;
     EXPECT_EQ(output, original) << size;
   }
 }
 
 TEST_F(ZlibGunzipTest, AllMembersComeOutOneAfterTheOther) {
-  EXPECT_EQ(run(gzip("one ") + gzip("") + gzip(text(300'000)) + gzip(" four")), GunzipResult::whole);
+  EXPECT_EQ(run(gzipOf("one ") + gzipOf("") + gzipOf(text(300'000)) + gzipOf(" four")), GunzipResult::whole);
   EXPECT_EQ(output, "one " + text(300'000) + " four");
 }
 
 TEST_F(ZlibGunzipTest, EveryShorterLengthIsTruncated) {
-  const std::string whole = gzip("first") + gzip(text(5000));
-  const std::size_t boundary = gzip("first").size();
+  const std::string whole = gzipOf("first") + gzipOf(text(5000));
+  const std::size_t boundary = gzipOf("first").size();
   for (std::size_t size = 0; size < whole.size(); ++size) {
     EXPECT_EQ(run(whole.substr(0, size)), size == boundary ? GunzipResult::whole : GunzipResult::truncated)
         << size;
@@ -86,7 +72,7 @@ TEST_F(ZlibGunzipTest, EveryShorterLengthIsTruncated) {
 }
 
 TEST_F(ZlibGunzipTest, BytesAfterTheLastMemberAreDamage) {
-  const std::string good = gzip("good");
+  const std::string good = gzipOf("good");
   EXPECT_EQ(run(good + "x"), GunzipResult::truncated) << "too short to tell from a cut header";
   EXPECT_EQ(run(good + "trailing"), GunzipResult::damaged);
   EXPECT_EQ(run(good + std::string(512, '\0')), GunzipResult::damaged);
@@ -94,7 +80,7 @@ TEST_F(ZlibGunzipTest, BytesAfterTheLastMemberAreDamage) {
 
 TEST_F(ZlibGunzipTest, NoFlippedBitGoesUnnoticed) {
   const std::string original = text(2000);
-  const std::string good = gzip(original);
+  const std::string good = gzipOf(original);
   for (std::size_t i = 0; i < good.size(); ++i) {
     for (int bit = 0; bit < 8; ++bit) {
       std::string bad = good;
@@ -112,18 +98,18 @@ TEST_F(ZlibGunzipTest, WhatIsNotGzipIsDamaged) {
 }
 
 TEST_F(ZlibGunzipTest, OutputStopsAtTheLimitOverAllMembers) {
-  const std::string bomb = gzip(std::string(50'000'000, '\0'));
+  const std::string bomb = gzipOf(std::string(50'000'000, '\0'));
   EXPECT_EQ(run(bomb, 49'999'999), GunzipResult::tooLarge);
   EXPECT_LE(output.size(), 49'999'999U);
   EXPECT_EQ(run(bomb, 50'000'000), GunzipResult::whole);
-  EXPECT_EQ(run(gzip("12345") + gzip("67890"), 9), GunzipResult::tooLarge);
-  EXPECT_EQ(run(gzip("12345") + gzip("67890"), 10), GunzipResult::whole);
-  EXPECT_EQ(run(gzip("1"), 0), GunzipResult::tooLarge);
+  EXPECT_EQ(run(gzipOf("12345") + gzipOf("67890"), 9), GunzipResult::tooLarge);
+  EXPECT_EQ(run(gzipOf("12345") + gzipOf("67890"), 10), GunzipResult::whole);
+  EXPECT_EQ(run(gzipOf("1"), 0), GunzipResult::tooLarge);
 }
 
 TEST_F(ZlibGunzipTest, AReceiverThatSaysNoEndsTheWork) {
   refuseBeyond = 600'000;
-  EXPECT_EQ(run(gzip(text(1'000'000))), GunzipResult::refused);
+  EXPECT_EQ(run(gzipOf(text(1'000'000))), GunzipResult::refused);
 }
 
 // ---- into a file ----
@@ -144,7 +130,7 @@ class GunzipIntoTest : public ZlibGunzipTest {
 
 TEST_F(GunzipIntoTest, TheOutputIsWrittenAndCounted) {
   const std::string original = text(1'000'000);
-  const auto outcome = into(gzip(original), 1'000'000);
+  const auto outcome = into(gzipOf(original), 1'000'000);
   EXPECT_EQ(outcome.result, GunzipResult::whole);
   EXPECT_EQ(outcome.size, original.size());
   EXPECT_EQ(outcome.writeError, 0);
@@ -152,16 +138,16 @@ TEST_F(GunzipIntoTest, TheOutputIsWrittenAndCounted) {
 }
 
 TEST_F(GunzipIntoTest, WhatGoesBeyondTheRoomIsCountedAndNotWritten) {
-  const auto outcome = into(gzip(text(1'000'000)), 500'000);
+  const auto outcome = into(gzipOf(text(1'000'000)), 500'000);
   EXPECT_EQ(outcome.result, GunzipResult::whole);
   EXPECT_EQ(outcome.size, 1'000'000U);
   EXPECT_LE(written().size(), 500'000U);
-  EXPECT_EQ(into(gzip(text(1'000'000)), 500'000, 999'999).result, GunzipResult::tooLarge);
+  EXPECT_EQ(into(gzipOf(text(1'000'000)), 500'000, 999'999).result, GunzipResult::tooLarge);
 }
 
 TEST_F(GunzipIntoTest, AWriteThatFailsEndsTheWorkWithItsError) {
   file.reset(::open("/dev/full", O_WRONLY | O_CLOEXEC));
-  const auto outcome = into(gzip(text(1'000'000)), kNoLimit);
+  const auto outcome = into(gzipOf(text(1'000'000)), kNoLimit);
   EXPECT_EQ(outcome.result, GunzipResult::refused);
   EXPECT_EQ(outcome.writeError, ENOSPC);
 }

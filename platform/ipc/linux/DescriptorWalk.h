@@ -45,7 +45,7 @@ class DescriptorCursor {
   std::uint32_t left_ = 0;
 };
 
-// Checks the framing of a datagram of at least 24 bytes. Nothing when no correct sender makes such a one:
+// Checks the framing of a datagram of at least 24 bytes. Returns nothing if it is malformed:
 // a region outside the datagram, unaligned, out of order or overlapping, a first region that does not follow
 // the message, or bytes after the last region.
 std::optional<DescriptorWalk> walkDescriptors(std::span<const std::byte> datagram) noexcept;

@@ -78,7 +78,7 @@ bool isCellularInterface(std::string_view name, const CellularRuleFiles& files) 
   return true;  // out of memory: on the safe side
 }
 
-ConnectionWay wayTowards(const sockaddr& peer, const CellularRuleFiles& files) noexcept try {
+ConnectionWay routeTo(const sockaddr& peer, const CellularRuleFiles& files) noexcept try {
   const auto index = interfaceTowards(peer);
   if (!index) return {};
   std::string name = nameOfInterface(*index);

@@ -26,11 +26,11 @@ struct ConnectionWay {
   // With `open`, the interface. A socket bound to it (SO_BINDTODEVICE) cannot stray when routes change.
   std::string interfaceName;
 };
-ConnectionWay wayTowards(const sockaddr& peer, const CellularRuleFiles& files = {}) noexcept;
+ConnectionWay routeTo(const sockaddr& peer, const CellularRuleFiles& files = {}) noexcept;
 
 // Whether looking up the name may be tried without a packet leaving by a cellular interface: some route that
-// leads further than the link is not cellular, or there is none at all; and every name server stands on a way
-// that is not cellular, unless the hosts file has the name.
+// leads further than the link is not cellular, or there is no route at all; and every name server is reached
+// without a cellular interface, unless the hosts file has the name.
 bool mayLookUpName(std::string_view host, const CellularRuleFiles& files = {}) noexcept;
 
 }  // namespace brenvik

@@ -61,7 +61,7 @@ class CellularRuleTest : public testing::Test {
   // The interface, or "cellular" or "none".
   std::string chosenFor(const sockaddr_storage& storage) {
     ConnectionWay way;
-    network.run([&] { way = wayTowards(reinterpret_cast<const sockaddr&>(storage), files); });
+    network.run([&] { way = routeTo(reinterpret_cast<const sockaddr&>(storage), files); });
     if (way.kind == ConnectionWay::Kind::open) return way.interfaceName;
     EXPECT_EQ(way.interfaceName, "");
     return way.kind == ConnectionWay::Kind::cellular ? "cellular" : "none";

@@ -61,7 +61,7 @@ class ManualWorkQueue final : public WorkQueue {
   const std::string& label() const noexcept override { return label_; }
   QualityOfService qualityOfService() const noexcept { return qualityOfService_; }
 
-  // What becomes of timers from now on, and the leeway each was asked for with.
+  // How timers behave from now on, and the leeway that each was given.
   enum class Timers { work, cannotBeMade, cannotBeArmed };
   Timers timers = Timers::work;
   std::vector<std::chrono::nanoseconds> leeways;

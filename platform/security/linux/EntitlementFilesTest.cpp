@@ -1093,7 +1093,8 @@ TEST_F(ExplanationTest, TheFileThatCameNearestIsNamedWithTheKeyThatDiffers) {
   grant("etc/e.plist", "<false/>");
   EXPECT_EQ(explain(caller.token()), (root / "etc/e.plist").string() + " gives it as false");
   grant("etc/e.plist", "<string>true</string>");
-  EXPECT_EQ(explain(caller.token()), (root / "etc/e.plist").string() + " gives it as no boolean");
+  EXPECT_EQ(explain(caller.token()),
+            (root / "etc/e.plist").string() + " gives it as a string, not a boolean");
   EXPECT_THAT(log.entries(), IsEmpty());
 }
 

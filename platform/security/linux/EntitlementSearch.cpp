@@ -80,6 +80,11 @@ const char* nameOf(Type type) noexcept {
   return "";
 }
 
+// The value of an entitlement that is not true.
+std::string valueInWords(const PropertyList& value) {
+  return value.is(Type::boolean) ? "false" : std::string(nameOf(value.type())) + ", not a boolean";
+}
+
 // What a file says of itself, all keys of the right type and form.
 struct Entry {
   std::string executable;
@@ -327,7 +332,11 @@ class EntitlementSearch::Run {
     verdict = worse(verdict, judgeExecutable(entry.executable));
     if (verdict != Verdict::matches && findings_ == nullptr) return verdict;
     if (hasKey) {
-      tell("Entitlements", Kind::holds, [&] { return "has " + std::string(name_); });
+      tell("Entitlements", Kind::holds, [&] {
+        const PropertyList value = entry.entitlements.find(name_);
+        const std::string has = "has " + std::string(name_);
+        return value.asBoolean() == true ? has : has + " as " + valueInWords(value);
+      });
     } else {
       tell("Entitlements", Kind::differs, [&] { return "does not have " + std::string(name_); });
       verdict = worse(verdict, Verdict::passedOver);
@@ -501,7 +510,7 @@ std::string whyNotEntitled(const EntitlementSearch::Result& result,
   }
   if (result.value.asBoolean() == true) return result.file + " gives it by now";
   if (result.value) {
-    return result.file + (result.value.is(Type::boolean) ? " gives it as false" : " gives it as no boolean");
+    return result.file + " gives it as " + valueInWords(result.value);
   }
   // The fewest keys that differ; among those, one that names the caller's executable; among those, the key
   // that is compared last.

@@ -44,8 +44,8 @@ def make_parser() -> argparse.ArgumentParser:
     parser.add_argument("--check", action="store_true", help="read the script, tell its first mistake, and leave")
     parser.add_argument("--strict", action="store_true",
                         help="fail at the end when a request had no rule, or a rule no request")
-    parser.add_argument("--log", metavar="FILE", help="where to write a line for each request; default: standard output, "
-                        "with COMMAND nowhere")
+    parser.add_argument("--log", metavar="FILE", help="where to write a line for each request, - for standard output; "
+                        "default: standard output, with COMMAND nowhere")
     parser.add_argument("--json", action="store_true", help="write each of those lines as a JSON object")
     parser.add_argument("--record", metavar="FILE", help="ask the real helper, and write what it answers as a script")
     parser.add_argument("--upstream", metavar="SOCKET", help=f"the real helper's socket; default: {service_socket()}")
@@ -68,6 +68,10 @@ def _line(name: str, arguments: dict, outcome: str, as_json: bool) -> str:
     return f"{name}{''.join(f' {key}={json.dumps(value, ensure_ascii=False)}' for key, value in readable.items())} -> {outcome}"
 
 
+def _name_of(script: str | None) -> str:
+    return "standard input" if script == "-" else str(script)
+
+
 def _read_script(path: str | None) -> Script:
     if path is None:
         return Script()
@@ -79,7 +83,7 @@ def _read_script(path: str | None) -> Script:
                 data = file.read()
     except OSError as error:
         raise _Usage(f"{path}: {error.strerror}") from None
-    name = "standard input" if path == "-" else path
+    name = _name_of(path)
     try:
         text = data.decode()
     except UnicodeDecodeError as error:
@@ -96,8 +100,10 @@ class _Program:
         self.options, self.command, self.log = options, command, log
         self.recorder = None
         self.listener = None
+        self.complaint = ""
         self.mock = Mock(script, directory=options.directory, log=self._log,
                          upstream=(options.upstream or service_socket()) if options.record else None)
+        self.mock._complain = self._complain
         try:
             if options.record:
                 self.recorder = self.mock._recorder = Recorder(options.record)
@@ -117,6 +123,12 @@ class _Program:
     def _log(self, name, arguments, outcome):
         if self.log is not None:
             print(_line(name, arguments, outcome, self.options.json), file=self.log, flush=True)
+
+    def _complain(self, error):
+        """A client tries a few times; the same is told once."""
+        if str(error) != self.complaint:
+            self.complaint = str(error)
+            print(f"{NAME}: the real helper cannot be asked: {error}", file=sys.stderr, flush=True)
 
     def _pass_on(self):
         event = self.listener.next(0)
@@ -168,7 +180,8 @@ class _Program:
     def strictly(self) -> int:
         """Tells what was not as scripted."""
         wrong = [f"a request of {name} had no rule" for name in dict.fromkeys(self.mock.unscripted)]
-        wrong += [f"line {each.line}: no request came for this rule" for each in self.mock.script.unused]
+        name = _name_of(self.options.script)
+        wrong += [f"{name}:{each.line}: no request came for this rule" for each in self.mock.script.unused]
         for each in wrong:
             print(f"{NAME}: {each}", file=sys.stderr)
         return FAILED if wrong else DONE
@@ -212,9 +225,11 @@ def _run(options, script: Script, command: list[str]) -> int:
     log = None if command else sys.stdout
     stack = contextlib.ExitStack()
     try:
-        if options.log:
+        if options.log == "-":
+            log = sys.stdout
+        elif options.log:
             log = stack.enter_context(open(options.log, "w", encoding="utf-8", errors="backslashreplace"))
-        elif log is not None and hasattr(log, "reconfigure"):
+        if log is sys.stdout and hasattr(log, "reconfigure"):
             log.reconfigure(errors="backslashreplace")
         program = _Program(options, script, command, log)
         stack.callback(program.close)
@@ -234,6 +249,10 @@ def main() -> int:
     except BrokenPipeError:
         os.dup2(os.open(os.devnull, os.O_WRONLY), 1)  # nobody reads any more
         return FAILED
-    except (Error, OSError) as error:
+    except OSError as error:
+        what = f"{error.filename}: {error.strerror}" if error.filename and error.strerror else error
+        print(f"{NAME}: {what}", file=sys.stderr)
+        return FAILED
+    except Error as error:
         print(f"{NAME}: {error}", file=sys.stderr)
         return FAILED

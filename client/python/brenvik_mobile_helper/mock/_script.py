@@ -153,7 +153,8 @@ class _Line:
             value, self.at = _JSON.raw_decode(self.text, self.at)
         except (ValueError, RecursionError) as error:
             reason = error.msg if isinstance(error, json.JSONDecodeError) else str(error)
-            raise self.error(f"{what} is not JSON: {reason} at column {self.at + 1}") from None
+            at = error.pos if isinstance(error, json.JSONDecodeError) else self.at
+            raise self.error(f"{what} is not JSON: {reason} at column {at + 1}") from None
         if self.at < len(self.text) and self.text[self.at] not in " \t#":
             raise self.error(f"expected a blank behind the value, not {self.text[self.at]!r}")
         self._skip()

@@ -88,6 +88,7 @@ class Mock:
         self._log = log
         self._upstream = upstream
         self._recorder = recorder
+        self._complain = lambda error: None  # called when the real helper does not let the mock in
         self._listening = None
         self._tasks: set = set()
         self._check_ins = [list(each) for each in self.script.check_ins]
@@ -245,9 +246,11 @@ class Mock:
                     try:
                         await asyncio.get_running_loop().run_in_executor(None, upstream.connect)
                     except HelperError as error:
+                        self._complain(error)
                         await self._send(service, _wire.status_reply(message_id, port, error.code))
                         return
-                    except Error:
+                    except Error as error:
+                        self._complain(error)
                         return
                 ours, theirs = socket.socketpair(socket.AF_UNIX, socket.SOCK_SEQPACKET)
                 ours.setblocking(False)

@@ -219,7 +219,7 @@ curl_socket_t CurlWebClient::Transfer::onOpenSocket(void* self, curlsocktype,
   UniqueFd fd(::socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol));
   if (!fd.isValid()) return CURL_SOCKET_BAD;
   if (!transfer.cellularAllowed) {
-    const ConnectionWay way = wayTowards(address->addr, transfer.settings->cellularFiles);
+    const ConnectionWay way = routeTo(address->addr, transfer.settings->cellularFiles);
     if (way.kind == ConnectionWay::Kind::cellular) transfer.wayWasCellular = true;
     if (way.kind != ConnectionWay::Kind::open) return CURL_SOCKET_BAD;
     if (::setsockopt(fd.get(), SOL_SOCKET, SO_BINDTODEVICE, way.interfaceName.c_str(),

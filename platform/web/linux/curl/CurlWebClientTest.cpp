@@ -3,7 +3,6 @@
 #include "platform/web/linux/curl/CurlWebClient.h"
 
 #include <gtest/gtest.h>
-#include <zlib.h>
 
 #include <array>
 #include <atomic>
@@ -15,6 +14,7 @@
 #include <optional>
 #include <system_error>
 
+#include "platform/gzip/fakes/GzipOf.h"
 #include "platform/net/fakes/PrivateNetwork.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/web/fakes/HttpsServer.h"
@@ -26,20 +26,6 @@ using namespace std::chrono_literals;
 using Connection = HttpsServer::Connection;
 
 const char kLocalNames[] = "DNS:localhost,IP:127.0.0.1";
-
-std::string gzip(const std::string& text) {
-  z_stream stream{};
-  EXPECT_EQ(::deflateInit2(&stream, 6, Z_DEFLATED, 15 + 16, 8, Z_DEFAULT_STRATEGY), Z_OK);
-  std::string result(::deflateBound(&stream, text.size()) + 64, '\0');
-  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(text.data()));
-  stream.avail_in = static_cast<uInt>(text.size());
-  stream.next_out = reinterpret_cast<Bytef*>(result.data());
-  stream.avail_out = static_cast<uInt>(result.size());
-  EXPECT_EQ(::deflate(&stream, Z_FINISH), Z_STREAM_END);
-  result.resize(stream.total_out);
-  ::deflateEnd(&stream);
-  return result;
-}
 
 std::string textOf(const WebResponse& response) {
   return {reinterpret_cast<const char*>(response.body.data()), response.body.size()};
@@ -257,7 +243,7 @@ TEST_F(CurlWebClientTest, HeadersOfAnInterimResponseAndTrailersDoNotCount) {
 }
 
 TEST_F(CurlWebClientTest, ContentEncodingIsDecodedAndContentTypeIsNot) {
-  const std::string packed = gzip("unpacked");
+  const std::string packed = gzipOf("unpacked");
   HttpsServer server(identity, [&](Connection& connection) {
     const auto request = connection.readRequest();
     const bool encoded = request.find("/encoded") != std::string::npos;
@@ -565,7 +551,7 @@ TEST_F(CurlWebClientTest, TheLimitCannotBeRaisedAboveTheClientsOwn) {
 }
 
 TEST_F(CurlWebClientTest, TheLimitCountsDecodedBytes) {
-  const std::string bomb = gzip(std::string(20'000'000, '\0'));
+  const std::string bomb = gzipOf(std::string(20'000'000, '\0'));
   HttpsServer server(identity, [&](Connection& connection) {
     connection.readRequest();
     connection.respond("200 OK\r\nContent-Encoding: gzip", bomb);
@@ -578,7 +564,7 @@ TEST_F(CurlWebClientTest, TheLimitCountsDecodedBytes) {
 
 TEST_F(CurlWebClientTest, TheLimitCountsEncodedBytesTooSoThatABodyWithoutOutputEnds) {
   // A gzip stream of empty blocks: it is well formed, never ends, and decodes to nothing.
-  const std::string header = gzip("").substr(0, 10);
+  const std::string header = gzipOf("").substr(0, 10);
   std::string empty;
   for (int i = 0; i < 20'000; ++i) empty += std::string("\0\0\0\xFF\xFF", 5);
   HttpsServer server(identity, [&](Connection& connection) {
@@ -651,9 +637,9 @@ TEST_F(CurlWebClientTest, TheBodyOfARedirectIsReadUpTo64KiB) {
 }
 
 TEST_F(CurlWebClientTest, TheBodyOfARedirectIsLimitedAsItTravelsAndDecoded) {
-  std::string empty = gzip("").substr(0, 10);  // a body that decodes to nothing, of empty blocks
+  std::string empty = gzipOf("").substr(0, 10);  // a body that decodes to nothing, of empty blocks
   while (empty.size() <= 64 << 10) empty += std::string("\0\0\0\xFF\xFF", 5);
-  const std::string packed = gzip(std::string((64 << 10) + 1, 'x'));
+  const std::string packed = gzipOf(std::string((64 << 10) + 1, 'x'));
   HttpsServer server(identity, [&](Connection& connection) {
     const auto request = connection.readRequest();
     if (request.starts_with("GET /target ")) return connection.respond("200 OK", "arrived");
