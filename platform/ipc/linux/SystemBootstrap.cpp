@@ -75,7 +75,11 @@ bool lockWithin(int fd) noexcept {
 bool SystemBootstrap::openToGroup(const std::string& path) const {
   if (::geteuid() == 0) {
     const auto group = numberOf(group_);
-    if (!group || ::lchown(path.c_str(), 0, *group) != 0) return false;
+    if (!group) return false;
+    if (::lchown(path.c_str(), 0, *group) != 0) {
+      // A number that this process's user namespace has not is no group, either.
+      if (errno != EINVAL || ::lchown(path.c_str(), 0, 0) != 0) return false;
+    }
   }
   return ::chmod(path.c_str(), 0660) == 0;
 }

@@ -5,6 +5,7 @@
 #include <grp.h>
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <sched.h>
 #include <sys/file.h>
 #include <sys/mman.h>
 #include <sys/resource.h>
@@ -881,6 +882,28 @@ TEST_F(ServiceTest, WithoutTheGroupTheSocketFileIsForRootsAlone) {
   ASSERT_EQ(::stat(path().c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 07777, 0660U);
   EXPECT_EQ(status.st_gid, ::getegid());
+}
+
+TEST_F(ServiceTest, InANamespaceWithoutTheGroupTheSocketFileIsForRootsAlone) {
+  const uid_t uid = ::geteuid();
+  const gid_t gid = ::getegid();
+  const pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    if (::unshare(CLONE_NEWUSER) != 0) ::_exit(77);
+    std::ofstream("/proc/self/setgroups") << "deny";
+    std::ofstream("/proc/self/uid_map") << "0 " << uid << " 1";
+    std::ofstream("/proc/self/gid_map") << "0 " << gid << " 1";
+    listen();
+    struct stat status {};
+    const bool good = ::stat(path().c_str(), &status) == 0 && (status.st_mode & 07777) == 0660U &&
+                      status.st_uid == 0 && status.st_gid == 0;
+    ::_exit(good && !HasFailure() ? 0 : 1);
+  }
+  int status = -1;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  if (WIFEXITED(status) && WEXITSTATUS(status) == 77) GTEST_SKIP() << "no user namespaces to be had";
+  EXPECT_EQ(status, 0);
 }
 
 TEST_F(ServiceTest, AStaleSocketFileIsReplaced) {
