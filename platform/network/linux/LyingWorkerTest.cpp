@@ -12,6 +12,7 @@
 #include <mutex>
 #include <string>
 
+#include "platform/base/fakes/LingeringSocket.h"
 #include "platform/network/EchoMessages.h"
 #include "platform/network/GeoMessages.h"
 #include "platform/network/GunzipMessages.h"
@@ -23,7 +24,6 @@
 #include "platform/network/linux/RemoteGunzip.h"
 #include "platform/network/linux/RemoteWebClient.h"
 #include "platform/runloop/linux/SystemQueues.h"
-#include "platform/base/fakes/LingeringSocket.h"
 #include "platform/worker/fakes/ThreadedWorker.h"
 
 namespace brenvik {
