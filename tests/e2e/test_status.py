@@ -108,7 +108,7 @@ class Socket(StatusTest):
         descriptors = self.daemon.descriptors()
         for _ in range(20):
             self.addCleanup(connect().close)
-        eventually(lambda: self.daemon.descriptors() == descriptors, what="no descriptor kept")
+        eventually(lambda: self.daemon.descriptors() <= descriptors, what="no descriptor kept")  # the question before may still have one
         told = facts()
         self.assertEqual((told["clients"], "leaves-in-ms" in told), ("0", True))
 
