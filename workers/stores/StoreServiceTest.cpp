@@ -5,6 +5,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -17,6 +18,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/files/fakes/ChildProcesses.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/sqlite/Sqlite.h"
@@ -367,6 +369,41 @@ TEST_F(StoreWorkerTest, WithoutTheAccountItDoesNotRunAndTheStoreCannotBeWritten)
   ASSERT_FALSE(log.entries().empty());
   EXPECT_EQ(log.entries().back(), errorLine("The voicemail store could not be written"));
   EXPECT_FALSE(isThere(voicemailFile));
+}
+
+// With an account of that name for root, too.
+TEST_F(StoreWorkerTest, ChannelsBeyondTheMostHangUpUntilOneIsFree) {
+  inPrivateMounts([&] {
+    if (::geteuid() == 0) {
+      const std::string accounts =
+          home.file("passwd", "root:x:0:0::/:/bin/sh\nmobile:x:4711:4711::/:/bin/sh\n");
+      ASSERT_EQ(::mount(accounts.c_str(), "/etc/passwd", nullptr, MS_BIND, nullptr), 0);
+    }
+    WorkerProgram worker(description(home.path()));
+    const auto open = [&](WorkerChannel* channel) {
+      return worker.open(static_cast<std::uint32_t>(stores::Work::voicemail), channel);
+    };
+    WorkerMessage message;
+    std::vector<WorkerChannel> channels(16);
+    for (WorkerChannel& each : channels) ASSERT_EQ(open(&each), WorkerResult::done);
+    WorkerChannel beyond;
+    ASSERT_EQ(open(&beyond), WorkerResult::done);
+    EXPECT_EQ(beyond.receive(&message, Clock::now() + 20s), WorkerResult::closed);
+    for (WorkerChannel& each : channels)
+      EXPECT_EQ(each.receive(&message, Clock::now()), WorkerResult::timedOut);
+    channels.pop_back();
+    const auto isServed = [&] {  // what is no request hangs up as well, but one with a folder is answered
+      WorkerMessage request = stores::encode(
+          stores::VoicemailRequest{.operation = stores::Operation::readToken, .key = {}, .token = {}});
+      request.descriptors.emplace_back(::open("/", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+      return open(&beyond) == WorkerResult::done && beyond.send(request) == WorkerResult::done &&
+             beyond.receive(&message, Clock::now() + 20s) == WorkerResult::done;
+    };
+    const auto end = Clock::now() + 20s;
+    bool served = isServed();
+    while (!served && Clock::now() < end) served = isServed();
+    EXPECT_TRUE(served);
+  });
 }
 
 }  // namespace
