@@ -514,15 +514,18 @@ TEST_F(BegunCallsTest, MoreThanTheChannelTakesAreSentAsThereIsRoom) {
 }
 
 TEST_F(BegunCallsTest, TenThousandCallsAndNoReaderEndWithAClearCodeAndLeakNothing) {
-  serveConnected([](Script& script) {
+  std::atomic<bool> hasCheckedIn = false;  // and holds nothing more that it made for that
+  serveConnected([&hasCheckedIn](Script& script) {
     {
       const UniqueFd channel = script.checkIn();  // is never read
+      hasCheckedIn = true;
       script.expectEnd(script.deathWatch());
     }
     const UniqueFd channel = script.checkIn();
     answer(script, channel, 7);
   });
   (void)bvmh_client_fd(client());
+  while (!hasCheckedIn) std::this_thread::yield();
   const std::size_t before = openDescriptors();
   bvmh_client_set_timeout(client(), kShort);
   const std::string value(70'000, 'v');  // does not fit a datagram: a descriptor each when it is sent
@@ -533,6 +536,7 @@ TEST_F(BegunCallsTest, TenThousandCallsAndNoReaderEndWithAClearCodeAndLeakNothin
                                   : BVMobileHelperClearVoicemailTokenBegin(client(), nullptr, nullptr);
     ASSERT_EQ(code, i < BVMH_MOST_CALLS ? BVMH_OK : BVMH_ERROR_TOO_MANY_CALLS);
   }
+  EXPECT_EQ(bvmh_begin_connect(client(), nullptr, nullptr), BVMH_ERROR_TOO_MANY_CALLS);
   EXPECT_EQ(openDescriptors(), before);
   for (int i = 0; i < BVMH_MOST_CALLS; ++i) {
     bvmh_result result = nextResult(client());

@@ -5,7 +5,9 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -17,6 +19,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/files/fakes/ChildProcesses.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/sqlite/Sqlite.h"
@@ -332,6 +335,54 @@ TEST_F(StoresTest, WhatIsNoRequestHangsUp) {
   EXPECT_TRUE(hangsUp(2, stores::encode(stores::RemapRequest{"a", "b"}))) << "before a folder";
 }
 
+TEST_F(StoresTest, WhatTheAccountMayNotDoIsSaidUnlessTheHelperInsists) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs a folder of another account";
+  home.directory("theirs");
+  home.directory("own");
+  ASSERT_EQ(::chmod(home.path().c_str(), 0755), 0);
+  ASSERT_EQ(::chmod((home / "theirs").c_str(), 0755), 0);
+  ASSERT_EQ(::chown((home / "own").c_str(), 4711, 4711), 0);
+  const pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    if (::setresgid(4711, 4711, 4711) != 0 || ::setresuid(4711, 4711, 4711) != 0) ::_exit(99);
+    ThreadedWorker worker{&serveStore};
+    WorkerChannel channel;
+    if (worker.open(static_cast<std::uint32_t>(stores::Work::voicemail), &channel) != WorkerResult::done)
+      ::_exit(98);
+    const auto outcome = [&](stores::Operation operation, const char* name, bool insists) {
+      WorkerMessage message = stores::encode(stores::VoicemailRequest{
+          .operation = operation, .serial = 1, .insists = insists, .key = {}, .token = "token"});
+      message.descriptors.emplace_back(::open((home / name).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+      if (channel.send(message) != WorkerResult::done ||
+          channel.receive(&message, Clock::now() + 20s) != WorkerResult::done)
+        ::_exit(97);
+      return stores::decodeVoicemailAnswer(message)->outcome;
+    };
+    using stores::Operation;
+    using stores::VoicemailOutcome;
+    if (outcome(Operation::setToken, "theirs", false) != VoicemailOutcome::notAllowed) ::_exit(1);
+    if (outcome(Operation::setToken, "theirs", true) == VoicemailOutcome::notAllowed) ::_exit(2);
+    if (outcome(Operation::readToken, "theirs", false) != VoicemailOutcome::done) ::_exit(3);
+    if (outcome(Operation::setToken, "own", false) != VoicemailOutcome::done) ::_exit(4);
+    ::_exit(0);
+  }
+  int status = -1;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  EXPECT_EQ(status, 0);
+}
+
+TEST(StoreMessagesTest, ARemapAnswerThatCannotBeIsNone) {
+  const auto decoded = [](bool done, std::size_t size) {
+    WorkerMessage message = stores::encode(stores::RemapAnswer{});
+    message.payload = FieldWriter().boolean(done).optionalText(std::string(size, 'x')).take();
+    return stores::decodeRemapAnswer(message).has_value();
+  };
+  EXPECT_TRUE(decoded(false, stores::kLongestDescription));
+  EXPECT_FALSE(decoded(false, stores::kLongestDescription + 1));
+  EXPECT_FALSE(decoded(true, 1)) << "what is done has no error";
+}
+
 // ---- over the program itself
 
 class StoreWorkerTest : public StoresTest {
@@ -367,6 +418,41 @@ TEST_F(StoreWorkerTest, WithoutTheAccountItDoesNotRunAndTheStoreCannotBeWritten)
   ASSERT_FALSE(log.entries().empty());
   EXPECT_EQ(log.entries().back(), errorLine("The voicemail store could not be written"));
   EXPECT_FALSE(isThere(voicemailFile));
+}
+
+// With an account of that name for root, too.
+TEST_F(StoreWorkerTest, ChannelsBeyondTheMostHangUpUntilOneIsFree) {
+  inPrivateMounts([&] {
+    if (::geteuid() == 0) {
+      const std::string accounts =
+          home.file("passwd", "root:x:0:0::/:/bin/sh\nmobile:x:4711:4711::/:/bin/sh\n");
+      ASSERT_EQ(::mount(accounts.c_str(), "/etc/passwd", nullptr, MS_BIND, nullptr), 0);
+    }
+    WorkerProgram worker(description(home.path()));
+    const auto open = [&](WorkerChannel* channel) {
+      return worker.open(static_cast<std::uint32_t>(stores::Work::voicemail), channel);
+    };
+    WorkerMessage message;
+    std::vector<WorkerChannel> channels(16);
+    for (WorkerChannel& each : channels) ASSERT_EQ(open(&each), WorkerResult::done);
+    WorkerChannel beyond;
+    ASSERT_EQ(open(&beyond), WorkerResult::done);
+    EXPECT_EQ(beyond.receive(&message, Clock::now() + 20s), WorkerResult::closed);
+    for (WorkerChannel& each : channels)
+      EXPECT_EQ(each.receive(&message, Clock::now()), WorkerResult::timedOut);
+    channels.pop_back();
+    const auto isServed = [&] {  // what is no request hangs up as well, but one with a folder is answered
+      WorkerMessage request = stores::encode(
+          stores::VoicemailRequest{.operation = stores::Operation::readToken, .key = {}, .token = {}});
+      request.descriptors.emplace_back(::open("/", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+      return open(&beyond) == WorkerResult::done && beyond.send(request) == WorkerResult::done &&
+             beyond.receive(&message, Clock::now() + 20s) == WorkerResult::done;
+    };
+    const auto end = Clock::now() + 20s;
+    bool served = isServed();
+    while (!served && Clock::now() < end) served = isServed();
+    EXPECT_TRUE(served);
+  });
 }
 
 }  // namespace

@@ -175,16 +175,19 @@ TEST_F(LinuxFileManagerTest, AnOrdinaryUsersCopyHasNoSetIdBitOfAnotherOwner) {
   ASSERT_EQ(::chmod(dir.path().c_str(), 0777), 0);
   if (::geteuid() != 0) GTEST_SKIP() << "needs root to prepare another's file";
   ASSERT_EQ(::chmod(source.c_str(), 06755), 0);
+  ASSERT_EQ(::mkfifo((dir / "pipe").c_str(), 0600), 0);
+  ASSERT_EQ(::chmod((dir / "pipe").c_str(), 06755), 0);
   const pid_t child = ::fork();
   if (child == 0) {
     if (::setresgid(4712, 4712, 4712) != 0 || ::setresuid(4711, 4711, 4711) != 0) ::_exit(9);
-    ::_exit(copy("source", "copy").succeeded() ? 0 : 1);
+    ::_exit(copy("source", "copy").succeeded() && copy("pipe", "copiedPipe").succeeded() ? 0 : 1);
   }
   int status = -1;
   ::waitpid(child, &status, 0);
   EXPECT_EQ(status, 0);
   EXPECT_EQ(statOf(dir / "copy").st_mode & 07777, 0755u);
   EXPECT_EQ(statOf(dir / "copy").st_uid, 4711u);
+  EXPECT_EQ(statOf(dir / "copiedPipe").st_mode & 07777, 0755u);
 }
 
 TEST_F(LinuxFileManagerTest, HardLinksInsideATreeStayHardLinks) {

@@ -261,6 +261,22 @@ TEST_F(LyingWorkerTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
   EXPECT_LT(Clock::now() - before, 2s) << "each of the thirteen lingers so long";
 }
 
+TEST_F(LyingWorkerTest, AnUnpackingIsNotKeptByMoreThanAThousandSignsOfLife) {
+  int signs = 1000;
+  lie = [&signs](WorkerChannel& channel) {
+    for (int i = 0; i < signs; ++i) {
+      auto sent = WorkerResult::full;
+      while (sent == WorkerResult::full) sent = channel.send({kAlive, {}, {}});
+      if (sent != WorkerResult::done) return;
+    }
+    (void)channel.send({kAnswer, encode(GunzipOutcome{GunzipResult::whole, 4, 0}), {}});
+  };
+  EXPECT_EQ(unpack(), GunzipResult::whole);
+  signs = 1001;
+  EXPECT_EQ(unpack(), GunzipResult::unavailable);
+  expectGivenUp(1);
+}
+
 TEST_F(LyingWorkerTest, SignsOfLifeKeepNoQuestionBeyondItsLimit) {
   lie = [](WorkerChannel& channel) {
     for (auto sent = WorkerResult::done; sent == WorkerResult::done || sent == WorkerResult::full;) {

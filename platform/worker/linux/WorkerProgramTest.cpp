@@ -408,11 +408,12 @@ class WorkerServiceTest : public WorkerProgramTest {
     EXPECT_EQ(::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
     return WorkerChannel(std::move(socket));
   }
-  static WorkerResult openOn(WorkerChannel& connection, WorkerChannel* channel) {
+  static WorkerResult openOn(WorkerChannel& connection, WorkerChannel* channel,
+                             WorkForTests work = WorkForTests::echo) {
     WorkerChannel theirs;
     EXPECT_EQ(WorkerChannel::makePair(channel, &theirs), WorkerResult::done);
     WorkerMessage opening;
-    opening.kind = static_cast<std::uint32_t>(WorkForTests::echo);
+    opening.kind = static_cast<std::uint32_t>(work);
     opening.descriptors.push_back(theirs.release());
     return connection.send(opening);
   }
@@ -425,7 +426,7 @@ class WorkerServiceTest : public WorkerProgramTest {
     const std::string pid = "LISTEN_PID=" + std::to_string(::getpid());
     char* const arguments[] = {const_cast<char*>(path.c_str()), nullptr};
     char* const environment[] = {const_cast<char*>(pid.c_str()), const_cast<char*>("LISTEN_FDS=1"),
-                                 const_cast<char*>(names.c_str()), nullptr};
+                                 const_cast<char*>(names.c_str()), const_cast<char*>("LANG=C"), nullptr};
     if (socket.get() == 3 ? ::fcntl(3, F_SETFD, 0) == 0 : ::dup2(socket.get(), 3) == 3)
       ::execve(path.c_str(), arguments, environment);
     ::_exit(1);
@@ -460,6 +461,24 @@ TEST_F(WorkerServiceTest, AServiceTakesEightConnectionsAndOneMoreWhenOneHasHungU
   EXPECT_EQ(receive(beyond), WorkerResult::done);
   EXPECT_EQ(message.kind, 7U);
   connections.clear();
+  reap(child);
+}
+
+TEST_F(WorkerServiceTest, AServiceKeepsNothingOfItsEnvironment) {
+  if (::geteuid() != 0) GTEST_SKIP() << "a worker talks to root only";
+  const UniqueFd socket = listen(SOCK_SEQPACKET, 16);
+  const pid_t child = startAsService(socket);
+  WorkerChannel connection = connect();
+  WorkerChannel channel;
+  ASSERT_EQ(openOn(connection, &channel, WorkForTests::report), WorkerResult::done);
+  ASSERT_EQ(receive(channel), WorkerResult::done);
+  FieldReader reader(message.payload);
+  (void)reader.u64();  // the account and its group
+  for (int i = 0; i < 3; ++i) (void)reader.text();
+  (void)reader.u32();  // the descriptors
+  EXPECT_EQ(reader.u32(), 0U) << "variables";
+  EXPECT_FALSE(reader.hasFailed());
+  connection.close();
   reap(child);
 }
 

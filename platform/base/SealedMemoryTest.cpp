@@ -1,0 +1,58 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/base/SealedMemory.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/mman.h>
+#include <unistd.h>
+
+#include "platform/base/UniqueFd.h"
+
+namespace brenvik {
+namespace {
+
+UniqueFd memoryOf(off_t size) {
+  UniqueFd memory(::memfd_create("test", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+  EXPECT_EQ(::ftruncate(memory.get(), size), 0);
+  return memory;
+}
+
+TEST(SealedMemoryTest, WhatIsSealedHasASizeForGood) {
+  const UniqueFd memory = memoryOf(5000);
+  EXPECT_EQ(sizeOfSealedMemory(memory.get()), -1);
+  EXPECT_TRUE(sealAgainstChange(memory.get()));
+  EXPECT_EQ(sizeOfSealedMemory(memory.get()), 5000);
+  EXPECT_NE(::ftruncate(memory.get(), 4999), 0);
+  EXPECT_NE(::ftruncate(memory.get(), 5001), 0);
+  EXPECT_NE(::pwrite(memory.get(), "x", 1, 0), 1);
+  EXPECT_FALSE(sealAgainstChange(memory.get())) << "no further seals";
+}
+
+TEST(SealedMemoryTest, EachOfTheThreeSealsIsNeeded) {
+  constexpr int kAll = F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE;
+  for (const int missing : {F_SEAL_SHRINK, F_SEAL_GROW, F_SEAL_WRITE}) {
+    const UniqueFd memory = memoryOf(10);
+    ASSERT_EQ(::fcntl(memory.get(), F_ADD_SEALS, kAll & ~missing), 0);
+    EXPECT_EQ(sizeOfSealedMemory(memory.get()), -1) << missing;
+    ASSERT_EQ(::fcntl(memory.get(), F_ADD_SEALS, missing), 0);
+    EXPECT_EQ(sizeOfSealedMemory(memory.get()), 10);
+  }
+}
+
+TEST(SealedMemoryTest, NothingElseHasASize) {
+  EXPECT_EQ(sizeOfSealedMemory(-1), -1);
+  const UniqueFd file(::open("/proc/self/exe", O_RDONLY | O_CLOEXEC));
+  EXPECT_EQ(sizeOfSealedMemory(file.get()), -1);
+}
+
+// Empty memory of huge pages needs none of them.
+TEST(SealedMemoryTest, MemoryOfHugePagesHasNone) {
+  const UniqueFd huge(::memfd_create("test", MFD_CLOEXEC | MFD_ALLOW_SEALING | MFD_HUGETLB));
+  if (!huge.isValid()) GTEST_SKIP() << "no huge pages here";
+  ASSERT_TRUE(sealAgainstChange(huge.get()));
+  EXPECT_EQ(sizeOfSealedMemory(huge.get()), -1);
+}
+
+}  // namespace
+}  // namespace brenvik
