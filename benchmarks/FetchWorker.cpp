@@ -45,8 +45,8 @@ struct Network {
   const std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
   SystemQueues queues{*loop};
   const std::unique_ptr<CurlWebClient> web = CurlWebClient::make(queues, curl);
-  NoGeo geo;
-  SystemEchoNetwork echo;
+  NoGeo geo{};
+  SystemEchoNetwork echo{};
   NetworkServing serving{{queues, *web, geo, echo}};
 };
 
@@ -57,9 +57,10 @@ int main() {
   using namespace brenvik;
   const CurlSettings curl = settings();  // the name of its own file cannot be read later
   std::unique_ptr<Network> network;
-  ::_exit(WorkerHost::run({.service = "fetch benchmark", .rights = {.accounts = {}, .otherwise = 65534}},
-                          [&](std::uint32_t work, WorkerChannel channel) {
-                            if (network == nullptr) network.reset(new Network{curl});
-                            network->serving.start(work, std::move(channel));
-                          }));
+  ::_exit(WorkerHost::run(
+      {.service = "fetch benchmark", .rights = {.accounts = {}, .otherwise = 65534, .keptCapabilities = {}}},
+      [&](std::uint32_t work, WorkerChannel channel) {
+        if (network == nullptr) network.reset(new Network{curl});
+        network->serving.start(work, std::move(channel));
+      }));
 }
