@@ -262,7 +262,8 @@ class AllocationsTest(HelperTest):
     def compare(self, when):
         def as_before():
             live, *others = self.holdings()
-            return others == list(self.held[1:]) and 0 <= live - self.held[0] <= self.forgiven
+            # A few less: a queue that was longer then has given a part of its room back.
+            return others == list(self.held[1:]) and -4 <= live - self.held[0] <= self.forgiven
         try:
             eventually(as_before, 3)
         except AssertionError:

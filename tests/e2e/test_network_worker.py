@@ -42,12 +42,21 @@ class WorkerTest:
         except ProcessLookupError:
             return False
         if how == signal.SIGKILL:  # what is asked of one that is still going is lost with it
-            eventually(lambda: self.daemon.network_worker() != worker)
+            eventually(lambda: has_ended(worker))
         return True
 
     def status(self):
         text = pathlib.Path(f"/proc/{self.daemon.network_worker()}/status").read_text()
         return dict(line.split(":\t", 1) for line in text.splitlines() if ":\t" in line)
+
+
+def has_ended(process):
+    """Its sockets, too, are closed: that comes after its memory and before this."""
+    try:
+        stat = pathlib.Path(f"/proc/{process}/stat").read_text()
+    except (FileNotFoundError, ProcessLookupError):
+        return True
+    return stat.rsplit(")", 1)[1].split()[0] == "Z"
 
 
 class Updates(WorkerTest, UpdateTest):

@@ -10,7 +10,7 @@ import tempfile
 import threading
 
 import wire
-from harness import ERROR, INFO, LOG_ERR, SANITIZED, Daemon, HelperTest, main
+from harness import ERROR, INFO, LOG_ERR, SANITIZED, SOCKET, Daemon, HelperTest, eventually, main
 
 DOMAIN = "com.example.test"
 FOLDER = pathlib.Path("/root/Library/Preferences")
@@ -180,6 +180,7 @@ class Kills(PreferencesTest):
 class Descriptors(PreferencesTest):
     def test_many_domains_leave_descriptors_and_memory_bounded(self):
         caller = self.client()
+        eventually(pathlib.Path(f"{SOCKET}.status").exists)  # which comes after the first answer
         before = self.daemon.descriptors()
         memory = self.daemon.resident_kib()
         for number in range(300):

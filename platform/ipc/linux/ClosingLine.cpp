@@ -75,7 +75,7 @@ struct Job {
 }  // namespace
 
 struct ClosingLine::State {
-  explicit State(std::size_t most) noexcept : capacity(most) {}
+  explicit State(std::size_t most) : capacity(most) {}
   bool push(Job&& job) noexcept;
   void startThread(const std::shared_ptr<State>& self) noexcept;
   void work();
