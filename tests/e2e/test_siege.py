@@ -428,7 +428,6 @@ class Siege(HelperTest):
         self.lay_siege(min(4.0, SECONDS), seeds)
         self.use_everything()  # a worker that was too slow under siege was given up, and is there again
         before, memory = self.settle(), self.daemon.resident_kib()
-        print("BEFORE", before, flush=True)
 
         self.lay_siege(SECONDS, seeds)
         self.assertEqual([what for _, what in BESIEGERS if self.done[what.__name__] == 0], [], "never to the end")
