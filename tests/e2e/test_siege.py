@@ -395,8 +395,6 @@ class Siege(HelperTest):
     def use_everything(self):
         """Queues, databases and the like are made on first use, and stay."""
         with wire.Client() as client:
-            # The store opens with the first token; reading one from a store that is not there opens nothing.
-            client.channel.exchange(wire.simple("SetVoicemailToken", b"a token".ljust(256, b"\0")))
             for name, size, _ in wire.ROUTINES:
                 body = bytes(size - 24 - len(wire.NDR)) if size > 24 else b""
                 if size == 36:
@@ -404,6 +402,12 @@ class Siege(HelperTest):
                 elif size == 48:
                     body = struct.pack("<dd", 48.2, 16.4)
                 client.channel.exchange(wire.simple(name, body))
+
+    def open_store(self):
+        """The voicemail store: its worker, channel and folder stay, but for one that was too slow and is given up."""
+        with wire.Client() as client:
+            client.channel.exchange(wire.simple("SetVoicemailToken", b"a token".ljust(256, b"\0")))
+        time.sleep(1)
 
     def settle(self):
         """What the daemon has open once that has not changed for five seconds: requests to the network take a while."""
@@ -426,8 +430,9 @@ class Siege(HelperTest):
         self.done = collections.Counter()
         seeds = random.Random(SEED)
         self.lay_siege(min(4.0, SECONDS), seeds)
-        self.use_everything()  # a worker that was too slow under siege was given up, and is there again
         before, memory = self.settle(), self.daemon.resident_kib()
+        self.open_store()
+        before |= collections.Counter(self.descriptors())
 
         self.lay_siege(SECONDS, seeds)
         self.assertEqual([what for _, what in BESIEGERS if self.done[what.__name__] == 0], [], "never to the end")
