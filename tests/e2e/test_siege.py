@@ -15,6 +15,8 @@ import collections
 import contextlib
 import json
 import os
+import pathlib
+import pwd
 import plistlib
 import random
 import re
@@ -26,7 +28,7 @@ import time
 import traceback
 
 import wire
-from harness import BUILD, SANITIZED, HelperTest, as_account, entitle, main
+from harness import BUILD, SANITIZED, HelperTest, as_account, entitle, eventually, main
 
 SECONDS = float(os.environ.get("BRENVIK_SIEGE_SECONDS", 15))
 SEED = int(os.environ.get("BRENVIK_SIEGE_SEED", random.SystemRandom().randrange(1 << 32)))
@@ -404,9 +406,18 @@ class Siege(HelperTest):
                 client.channel.exchange(wire.simple(name, body))
 
     def open_store(self):
-        """The voicemail store: its worker, channel and folder stay, but for one that was too slow and is given up."""
-        with wire.Client() as client:
-            client.channel.exchange(wire.simple("SetVoicemailToken", b"a token".ljust(256, b"\0")))
+        """The voicemail store: its worker, channel and folder stay. One that is slower than a second is given up."""
+        mobile = pwd.getpwnam("mobile")
+        home = pathlib.Path(mobile.pw_dir)  # some of the besiegers make and remove folders like this one
+        home.mkdir(parents=True, exist_ok=True)
+        os.chown(home, mobile.pw_uid, mobile.pw_gid)
+
+        def is_open():
+            with wire.Client() as client:
+                client.channel.exchange(wire.simple("SetVoicemailToken", b"a token".ljust(256, b"\0")))
+                reply, _ = client.channel.exchange(wire.simple("CopyVoicemailToken"))
+            return b"a token" in reply
+        eventually(is_open, 60)
         time.sleep(1)
 
     def settle(self):
