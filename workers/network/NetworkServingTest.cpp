@@ -9,6 +9,7 @@
 
 #include <cerrno>
 #include <future>
+#include <mutex>
 #include <string>
 
 #include "platform/geo/fakes/ManualGeoService.h"
@@ -87,8 +88,11 @@ class AnsweringGeo final : public GeoTickets {
       void submit(ReverseGeocodeHandler handler, const GeoNetworkActivity*,
                   const std::shared_ptr<WorkQueue>& queue) override {
         if (geo_.silent) return;
+        {
+          const std::lock_guard lock(geo_.mutex);  // several channels may ask at once
+          geo_.asked = coordinate_;
+        }
         queue->post([handler, items = geo_.items, error = geo_.error] { handler(items, error); });
-        geo_.asked = coordinate_;
       }
 
      private:
@@ -117,6 +121,7 @@ class AnsweringGeo final : public GeoTickets {
   std::optional<MapItems> items;
   std::optional<GeoIpResult> address;
   std::optional<GeoError> error;
+  std::mutex mutex;  // guards what follows
   Coordinate asked;
 };
 

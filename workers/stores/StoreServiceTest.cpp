@@ -337,6 +337,9 @@ TEST_F(StoresTest, WhatIsNoRequestHangsUp) {
 
 TEST_F(StoresTest, WhatTheAccountMayNotDoIsSaidUnlessTheHelperInsists) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs a folder of another account";
+#ifdef __SANITIZE_THREAD__
+  GTEST_SKIP() << "ThreadSanitizer starts no threads after fork(2)";
+#endif
   home.directory("theirs");
   home.directory("own");
   ASSERT_EQ(::chmod(home.path().c_str(), 0755), 0);
