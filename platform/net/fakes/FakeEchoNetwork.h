@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <atomic>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
@@ -43,8 +44,8 @@ class FakeEchoNetwork final : public EchoNetwork {
   // What the prober did.
   std::vector<std::string> namesAsked;
   std::vector<std::pair<int, std::uint16_t>> opened;  // protocol, identifier
-  int openSockets = 0;
-  std::vector<std::string> calls;  // on sockets, in order
+  std::atomic<int> openSockets{0};  // a socket may go on another thread than the one that has the next
+  std::vector<std::string> calls;   // on sockets, in order
   std::vector<std::vector<std::byte>> sent;
   in_addr destination{};
   std::chrono::microseconds elapsed{0};
