@@ -63,7 +63,7 @@ constexpr rlim_t kDescriptors = 16384;
 
 // What programs look for in the file of this one, in the form of what(1), to learn which version is
 // installed.
-[[gnu::used]] constexpr char kWhat[] = "@(#)BrenvikMobileHelper " BRENVIK_VERSION;
+[[gnu::used, gnu::retain]] constexpr char kWhat[] = "@(#)BrenvikMobileHelper " BRENVIK_VERSION;
 constexpr const char* kVersion = kWhat + sizeof "@(#)BrenvikMobileHelper";
 
 void prepareProcess() noexcept {
