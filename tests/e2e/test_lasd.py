@@ -241,11 +241,14 @@ class Updates(UpdateTest):
         request_check(self.client_for_all(), ALL)
         eventually(lambda: self.records() == manifest)
 
-    def test_a_gzip_bomb_stops_before_the_disk_is_full(self):
-        run = network.run
+    def mount_directory(self, size):
+        """A disk of that size for the databases. It goes at once, whatever of it somebody still has open."""
         DIRECTORY.mkdir()
-        run("mount", "-t", "tmpfs", "-o", "size=24m", "none", DIRECTORY)
-        self.addCleanup(run, "umount", DIRECTORY)
+        network.run("mount", "-t", "tmpfs", "-o", f"size={size}", "none", DIRECTORY)
+        self.addCleanup(network.run, "umount", "--lazy", DIRECTORY)
+
+    def test_a_gzip_bomb_stops_before_the_disk_is_full(self):
+        self.mount_directory("24m")
         self.serve({"gsm": "1", "lte": "1"}, lambda name, version: bytes(1 << 27) if name == "gsm" else b"small")
         self.assertEqual(self.check(count=2), ["UpdateFailed", "UpdateAvailable lte"])
         room = (24 << 20) - (24 << 20) // 50
@@ -255,9 +258,7 @@ class Updates(UpdateTest):
         self.assertEqual([f.name for f in DIRECTORY.iterdir()], ["lte.db"])
 
     def test_a_disk_of_a_few_megabytes_takes_a_database(self):
-        DIRECTORY.mkdir()
-        network.run("mount", "-t", "tmpfs", "-o", "size=4m", "none", DIRECTORY)
-        self.addCleanup(network.run, "umount", DIRECTORY)
+        self.mount_directory("4m")
         manifest = self.serve({"gsm": "1"}, lambda name, version: bytes(3 << 20))
         self.assertEqual(self.check(), available(["gsm"]))
         self.assert_installed(manifest, lambda name, version: bytes(3 << 20))

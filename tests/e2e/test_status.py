@@ -105,10 +105,10 @@ class Socket(StatusTest):
     def test_a_connection_is_no_client(self):
         wire.Client().close()
         eventually(lambda: "leaves-in-ms" in facts(), what="the countdown, whose clock is a descriptor")
-        descriptors = self.daemon.descriptors()
+        sockets = self.daemon.sockets()
         for _ in range(20):
             self.addCleanup(connect().close)
-        eventually(lambda: self.daemon.descriptors() <= descriptors, what="no descriptor kept")  # the question before may still have one
+        eventually(lambda: self.daemon.sockets() <= sockets, what="no connection kept")  # the question before may still have one
         told = facts()
         self.assertEqual((told["clients"], "leaves-in-ms" in told), ("0", True))
 
@@ -116,7 +116,7 @@ class Socket(StatusTest):
         wire.Client().close()
         eventually(lambda: "leaves-in-ms" in facts(), what="the countdown, whose clock is a descriptor")
         client = self.client()
-        descriptors = self.daemon.descriptors()
+        sockets = self.daemon.sockets()
         held = []
         for _ in range(200):
             sock = socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET)
@@ -126,10 +126,10 @@ class Socket(StatusTest):
                 sock.connect(str(STATUS))
                 held.append(sock)
             client.integer("IsVoicemailServiceSubscribed")
-            self.assertLessEqual(self.daemon.descriptors(), descriptors + 20)
+            self.assertLessEqual(self.daemon.sockets(), sockets + 20)
         self.assertGreater(len(held), 20)
         self.assertTrue(self.daemon.running())
-        eventually(lambda: self.daemon.descriptors() <= descriptors, what="no descriptor kept")
+        eventually(lambda: self.daemon.sockets() <= sockets, what="no connection kept")
         # Each of them was told, or closed; and another account is not kept from asking.
         self.assertEqual(as_account("stranger", lambda: 0 if answers() else 1), 0)
 
