@@ -21,7 +21,7 @@ bool look(void* library, const char* name, Function* function) noexcept {
 }
 
 bool limit(const SqliteFunctions& functions) noexcept {
-  (void)functions.hard_heap_limit64(kMostSqliteMemory);
+  (void)functions.hard_heap_limit64(kMaxSqliteMemory);
   sqlite3_vfs* const files = functions.vfs_find(nullptr);
   return files != nullptr && files->iVersion >= 3 &&
          understandHeldFolders(files, [](void* vfs, const char* name, void (*function)()) {

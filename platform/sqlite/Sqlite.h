@@ -31,11 +31,11 @@ struct SqliteFunctions {
 
 // Bytes that SQLite may have at once, for all connections of the process: ten times what a remap of 100,000
 // contacts takes. A statement that needs more fails with SQLITE_NOMEM.
-inline constexpr std::int64_t kMostSqliteMemory = std::int64_t{32} << 20;
+inline constexpr std::int64_t kMaxSqliteMemory = std::int64_t{32} << 20;
 
 // The functions, all of them, for the life of the process; null where there is no usable library (asked
 // again, it looks again), or where *lackedMemory, if given, says so, none could be loaded now. Any thread.
-// The library has kMostSqliteMemory, and opens files without waiting for whoever is at the other end of a
+// The library has kMaxSqliteMemory, and opens files without waiting for whoever is at the other end of a
 // pipe.
 const SqliteFunctions* sqlite(bool* lackedMemory = nullptr) noexcept;
 

@@ -14,7 +14,7 @@ constexpr std::uint32_t kAttributesEntry = 9;
 constexpr std::size_t kBlockOffset = 34;  // behind the entry's 32 bytes and two of padding
 constexpr std::uint32_t kBlockMagic = 0x41545452;
 constexpr std::size_t kFirstAttribute = kBlockOffset + 36;  // behind the block's own head
-constexpr std::size_t kMostAttributes = 64;
+constexpr std::size_t kMaxAttributes = 64;
 constexpr std::size_t kLongestName = 200;  // "user." goes before it, and the kernel's limit is 255
 
 // Big-endian; nothing beyond the end.
@@ -49,7 +49,7 @@ std::vector<std::pair<std::string, std::string>> extendedAttributesOf(std::strin
       return found;
     }
     std::size_t next = offset + kFirstAttribute;
-    for (std::uint32_t k = 0; k < count && found.size() < kMostAttributes; ++k) {
+    for (std::uint32_t k = 0; k < count && found.size() < kMaxAttributes; ++k) {
       std::uint32_t valueAt = 0;
       std::uint32_t valueLength = 0;
       std::uint32_t nameLength = 0;  // its NUL included

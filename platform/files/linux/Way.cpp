@@ -15,7 +15,7 @@
 namespace brenvik {
 namespace {
 
-constexpr int kMostLinks = 40;  // as the kernel follows on one way
+constexpr int kMaxLinks = 40;  // as the kernel follows on one way
 
 bool isOwn(const struct stat& info) { return info.st_uid == 0 || info.st_uid == ::geteuid(); }
 
@@ -68,7 +68,7 @@ int openDirectory(const std::string& path, UniqueFd* directory, Links links) {
       at = std::move(next);
       continue;
     }
-    if (++followed > kMostLinks) return ELOOP;
+    if (++followed > kMaxLinks) return ELOOP;
     char text[PATH_MAX];
     const ssize_t length = ::readlinkat(next.get(), "", text, sizeof text);
     if (length <= 0) return length < 0 ? errno : ENOENT;

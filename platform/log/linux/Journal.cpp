@@ -29,7 +29,7 @@ iovec io(std::string_view bytes) noexcept { return {const_cast<char*>(bytes.data
 class Entry {
  public:
   explicit Entry(std::span<const JournalField> fields) noexcept {
-    for (const JournalField& field : fields.first(std::min(fields.size(), Journal::kMostFields))) add(field);
+    for (const JournalField& field : fields.first(std::min(fields.size(), Journal::kMaxFields))) add(field);
   }
   std::span<iovec> bytes() noexcept { return {parts_.data(), count_}; }
 
@@ -51,9 +51,9 @@ class Entry {
   }
   void append(std::string_view bytes) noexcept { parts_[count_++] = io(bytes); }
 
-  std::array<iovec, 5 * Journal::kMostFields> parts_;
+  std::array<iovec, 5 * Journal::kMaxFields> parts_;
   std::size_t count_ = 0;
-  std::array<std::uint64_t, Journal::kMostFields> lengths_;
+  std::array<std::uint64_t, Journal::kMaxFields> lengths_;
   std::size_t lengthCount_ = 0;
 };
 

@@ -140,7 +140,7 @@ void collect(const rtmsg& route, std::span<const std::byte> attributes, unsigned
 
 }  // namespace
 
-std::optional<unsigned> interfaceTowards(const sockaddr& peer) noexcept try {
+std::optional<unsigned> interfaceTo(const sockaddr& peer) noexcept try {
   std::array<std::byte, 16> address{};
   std::size_t length = 0;
   auto family = static_cast<std::uint8_t>(peer.sa_family);

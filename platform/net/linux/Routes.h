@@ -14,7 +14,7 @@ namespace brenvik {
 
 // Index of the interface that a packet to `peer` (AF_INET or AF_INET6) would leave by. Nothing when there is
 // no route, the family is another one or the kernel did not answer.
-std::optional<unsigned> interfaceTowards(const sockaddr& peer) noexcept;
+std::optional<unsigned> interfaceTo(const sockaddr& peer) noexcept;
 
 // The interfaces of all unicast routes that lead further than the link, of every table; the loopback
 // interface, link-local destinations and dead next hops left out. Nothing when the kernel did not answer.

@@ -21,7 +21,7 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 // Signs of life before a file must be unpacked: at one every kAliveInterval, more than an hour of them.
-constexpr int kMostSignsOfLife = 1000;
+constexpr int kMaxSignsOfLife = 1000;
 
 UniqueFd duplicate(int fd) noexcept { return UniqueFd(::fcntl(fd, F_DUPFD_CLOEXEC, 0)); }
 
@@ -87,7 +87,7 @@ GunzipOutcome RemoteGunzip::gunzipInto(const GunzipInput& input, int file, std::
       break;
     }
     if (answer.kind != static_cast<std::uint32_t>(NetworkMessage::alive) || !answer.payload.empty()) break;
-    if (++signsOfLife > kMostSignsOfLife) break;
+    if (++signsOfLife > kMaxSignsOfLife) break;
     heard = Clock::now();
   }
   worker_.giveUp(&channel);

@@ -28,8 +28,8 @@ namespace brenvik {
 namespace {
 
 // Clients name domains freely; each that is kept costs its content and one descriptor.
-constexpr std::size_t kMostDomains = 16;
-constexpr std::size_t kMostKeptBytes = std::size_t{16} << 20;
+constexpr std::size_t kMaxDomains = 16;
+constexpr std::size_t kMaxKeptBytes = std::size_t{16} << 20;
 
 std::string homeOfEffectiveUser(int* failure) {
   std::vector<char> buffer(1024);
@@ -279,7 +279,7 @@ std::shared_ptr<FilePreferences::Domain> FilePreferences::find(std::string_view 
     const auto weight = one->use_count() > 1 ? std::nullopt : (*one)->weight();
     ++count;
     bytes += weight.value_or(0);
-    one = weight && (count >= kMostDomains || bytes > kMostKeptBytes) ? domains_.erase(one) : std::next(one);
+    one = weight && (count >= kMaxDomains || bytes > kMaxKeptBytes) ? domains_.erase(one) : std::next(one);
   }
   domains_.push_front(std::make_shared<Domain>(std::move(*place), std::string(domain),
                                                PreferencesScope{user, host}, patience_));

@@ -19,7 +19,7 @@ namespace brenvik {
 namespace {
 
 // "voicemail.db.damaged", then "voicemail.db.damaged.1" and so on.
-constexpr int kMostMovedAside = 100;
+constexpr int kMaxMovedAside = 100;
 
 constexpr const char* kFile = "voicemail.db";
 
@@ -192,7 +192,7 @@ int SqliteVoicemailStore::run(const Place& place, SqliteTimeLimit& limit, const 
 // Nothing in it can be read any more; a person may still want to look at it, so an earlier one stays, too.
 bool SqliteVoicemailStore::moveAside(const Place& place) {
   int error = 0;
-  for (int number = 0; number < kMostMovedAside; ++number) {
+  for (int number = 0; number < kMaxMovedAside; ++number) {
     std::string name = std::string(kFile) + ".damaged";
     if (number > 0) name += "." + std::to_string(number);
     if (renameToFreeName(place.folder, kFile, name.c_str()) == 0) {
