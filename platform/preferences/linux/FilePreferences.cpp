@@ -3,7 +3,6 @@
 #include "platform/preferences/linux/FilePreferences.h"
 
 #include <fcntl.h>
-#include <pwd.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -15,6 +14,7 @@
 #include <vector>
 
 #include "platform/base/ErrorText.h"
+#include "platform/base/PasswordEntry.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/preferences/linux/DomainFile.h"
@@ -32,20 +32,10 @@ constexpr std::size_t kMaxDomains = 16;
 constexpr std::size_t kMaxKeptBytes = std::size_t{16} << 20;
 
 std::string homeOfEffectiveUser(int* failure) {
-  std::vector<char> buffer(1024);
-  passwd entry{};
-  passwd* found = nullptr;
-  int error = 0;
-  errno = 0;
-  while ((error = ::getpwuid_r(::geteuid(), &entry, buffer.data(), buffer.size(), &found)) == ERANGE) {
-    buffer.resize(buffer.size() * 2);
-    errno = 0;
-  }
-  if (error == 0 && found != nullptr && found->pw_dir != nullptr) return found->pw_dir;
-  // A look-up that failed may say that there is no such account; errno keeps the truth.
-  if (error == ENOMEM || errno == ENOMEM) throw std::bad_alloc();
-  *failure = error != 0 ? error : errno;
-  return {};
+  std::optional<PasswordEntry> entry;
+  *failure = readPasswordEntry(::geteuid(), &entry);
+  if (*failure == ENOMEM) throw std::bad_alloc();
+  return entry ? entry->home : std::string();
 }
 
 // machine-id(5): 32 lower-case hexadecimal digits and a line feed.
