@@ -15,7 +15,6 @@ using stores::Operation;
 using stores::VoicemailAnswer;
 using stores::VoicemailOutcome;
 using stores::VoicemailRequest;
-using Clock = std::chrono::steady_clock;
 
 // Sends the request, with the folder when the worker does not have it yet. A worker that has gone since the
 // last request is replaced once: it has seen nothing of this one.
@@ -70,35 +69,43 @@ RemoteVoicemailStore::Result RemoteVoicemailStore::exchange(VoicemailRequest* re
   }
   bool isRepeated = false;
   for (;;) {
-    request->serial = ++serial_;
-    const WorkerResult sent = send(*request, folder);
-    if (sent != WorkerResult::done)
-      return sent == WorkerResult::outOfMemory ? Result::outOfMemory : Result::failed;
-    WorkerMessage message;
-    const WorkerResult received = channel_.receive(&message, deadline);
-    if (received == WorkerResult::outOfMemory) {
-      channel_.close();
-      return Result::outOfMemory;
-    }
-    auto decoded = received == WorkerResult::done ? stores::decodeVoicemailAnswer(message) : std::nullopt;
-    if (!decoded || decoded->serial != request->serial) {
-      channel_.discard(&message);
-      const bool hasDied = received == WorkerResult::closed;
-      // Of an answer that comes later nobody would know what it answers.
-      worker_.giveUp(&channel_);
-      // Whatever it was ended by; each operation is the same when it is done twice.
-      if (hasDied && !std::exchange(isRepeated, true)) continue;
-      return Result::failed;
-    }
-    if (decoded->outcome == VoicemailOutcome::notAllowed) {
-      if (request->insists) return Result::failed;
-      (void)folder_.prepare(folder);  // somebody of root's has put a file there since
-      request->insists = true;
-      continue;
-    }
-    *answer = std::move(*decoded);
-    return answer->outcome == VoicemailOutcome::outOfMemory ? Result::outOfMemory : Result::done;
+    const Received received = ask(request, folder, deadline, answer);
+    // Whatever the worker was ended by; each operation is the same when it is done twice.
+    if (received == Received::workerDied && !std::exchange(isRepeated, true)) continue;
+    if (received == Received::outOfMemory) return Result::outOfMemory;
+    if (received != Received::answer) return Result::failed;
+    if (answer->outcome == VoicemailOutcome::outOfMemory) return Result::outOfMemory;
+    if (answer->outcome != VoicemailOutcome::notAllowed) return Result::done;
+    if (std::exchange(request->insists, true)) return Result::failed;
+    (void)folder_.prepare(folder);  // somebody of root's has put a file there since
   }
+}
+
+// Asks once and waits for the answer.
+RemoteVoicemailStore::Received RemoteVoicemailStore::ask(VoicemailRequest* request,
+                                                         const StoreFolder::Opened& folder,
+                                                         Clock::time_point deadline,
+                                                         VoicemailAnswer* answer) {
+  request->serial = ++serial_;
+  const WorkerResult sent = send(*request, folder);
+  if (sent != WorkerResult::done) {
+    return sent == WorkerResult::outOfMemory ? Received::outOfMemory : Received::nothing;
+  }
+  WorkerMessage message;
+  const WorkerResult received = channel_.receive(&message, deadline);
+  if (received == WorkerResult::outOfMemory) {
+    channel_.close();
+    return Received::outOfMemory;
+  }
+  auto decoded = received == WorkerResult::done ? stores::decodeVoicemailAnswer(message) : std::nullopt;
+  if (decoded && decoded->serial == request->serial) {
+    *answer = std::move(*decoded);
+    return Received::answer;
+  }
+  channel_.discard(&message);
+  // Nobody would know what an answer that comes later answers.
+  worker_.giveUp(&channel_);
+  return received == WorkerResult::closed ? Received::workerDied : Received::nothing;
 }
 
 bool RemoteVoicemailStore::perform(Operation operation, const std::string* key, const std::string* token,
@@ -114,7 +121,7 @@ bool RemoteVoicemailStore::perform(Operation operation, const std::string* key, 
     VoicemailAnswer answer;
     result = exchange(&request, &answer);
     isToldByWorker = result == Result::outOfMemory && answer.outcome == VoicemailOutcome::outOfMemory;
-    if (found != nullptr) *found = std::move(answer.token);
+    if (found != nullptr && result == Result::done) *found = std::move(answer.token);
   } catch (const std::bad_alloc&) {
     // What the worker says now answers nothing any more. The lack is this process's own.
     channel_.close();

@@ -34,10 +34,14 @@ class RemoteVoicemailStore final : public VoicemailStore {
   bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept override;
 
  private:
+  using Clock = std::chrono::steady_clock;
   enum class Result { done, failed, outOfMemory };
   bool perform(stores::Operation operation, const std::string* key, const std::string* token,
                std::optional<std::string>* found) noexcept;
   Result exchange(stores::VoicemailRequest* request, stores::VoicemailAnswer* answer);
+  enum class Received { answer, nothing, workerDied, outOfMemory };
+  Received ask(stores::VoicemailRequest* request, const StoreFolder::Opened& folder,
+               Clock::time_point deadline, stores::VoicemailAnswer* answer);
   WorkerResult send(const stores::VoicemailRequest& request, const StoreFolder::Opened& folder);
 
   Worker& worker_;

@@ -13,6 +13,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "platform/base/WriteAll.h"
 #include "platform/files/archive/ArchiveEntryPath.h"
 #include "platform/files/archive/ResourceCompanion.h"
 #include "platform/files/linux/FileContents.h"

@@ -2,14 +2,14 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/gzip/linux/ZlibGunzip.h"
 
-#include <unistd.h>
 #include <zlib.h>
 
 #include <algorithm>
-#include <cerrno>
 #include <limits>
 #include <memory>
 #include <new>
+
+#include "platform/base/WriteAll.h"
 
 namespace brenvik {
 namespace {
@@ -21,18 +21,6 @@ constexpr int kGzipWrapper = 15 + 16;  // largest window, gzip header and traile
 struct InflateEnd {
   void operator()(z_stream* stream) const noexcept { (void)::inflateEnd(stream); }
 };
-
-// 0, or the number of the error.
-int writeAll(int file, std::span<const std::byte> bytes) noexcept {
-  while (!bytes.empty()) {
-    const auto written = ::write(file, bytes.data(), bytes.size());
-    if (written < 0 && errno == EINTR) continue;
-    if (written < 0) return errno;
-    if (written == 0) return EIO;
-    bytes = bytes.subspan(static_cast<std::size_t>(written));
-  }
-  return 0;
-}
 
 uInt clamped(std::size_t size) noexcept {
   return static_cast<uInt>(std::min<std::size_t>(size, std::numeric_limits<uInt>::max()));

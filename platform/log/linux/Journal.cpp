@@ -15,6 +15,7 @@
 #include <cstring>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/base/WriteAll.h"
 
 namespace brenvik {
 namespace {
@@ -56,25 +57,6 @@ class Entry {
   std::array<std::uint64_t, Journal::kMaxFields> lengths_;
   std::size_t lengthCount_ = 0;
 };
-
-// Writes everything to a file at its offset; `bytes` is used up.
-bool writeAll(int fd, std::span<iovec> bytes) noexcept {
-  while (!bytes.empty()) {
-    const ssize_t written = ::writev(fd, bytes.data(), static_cast<int>(bytes.size()));
-    if (written < 0 && errno == EINTR) continue;
-    if (written <= 0) return false;
-    auto left = static_cast<std::size_t>(written);
-    while (!bytes.empty() && left >= bytes.front().iov_len) {
-      left -= bytes.front().iov_len;
-      bytes = bytes.subspan(1);
-    }
-    if (left > 0) {
-      bytes.front().iov_base = static_cast<char*>(bytes.front().iov_base) + left;
-      bytes.front().iov_len -= left;
-    }
-  }
-  return true;
-}
 
 }  // namespace
 
@@ -127,7 +109,7 @@ bool Journal::send(msghdr& message) noexcept {
 bool Journal::sendInMemory(std::span<iovec> bytes) noexcept {
   const UniqueFd memory(::memfd_create("journal-entry", MFD_CLOEXEC | MFD_ALLOW_SEALING));
   constexpr int kSeals = F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE | F_SEAL_SEAL;
-  if (!memory.isValid() || !writeAll(memory.get(), bytes) ||
+  if (!memory.isValid() || writeAll(memory.get(), bytes) != 0 ||
       ::fcntl(memory.get(), F_ADD_SEALS, kSeals) != 0) {
     return false;
   }

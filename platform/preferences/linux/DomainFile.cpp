@@ -19,6 +19,7 @@
 
 #include "platform/base/ErrorText.h"
 #include "platform/base/Rename.h"
+#include "platform/base/WriteAll.h"
 #include "platform/log/Log.h"
 #include "platform/plist/PropertyListCodec.h"
 
@@ -74,25 +75,7 @@ int writeAll(int file, std::span<const std::string_view> content) noexcept {
       pieces[count++] = {const_cast<char*>(piece.data()), piece.size()};
     }
   }
-  iovec* next = pieces.data();
-  while (count > 0) {
-    const ssize_t written = ::writev(file, next, static_cast<int>(count));
-    if (written < 0) {
-      if (errno == EINTR) continue;
-      return errno;
-    }
-    auto left = static_cast<std::size_t>(written);
-    while (count > 0 && left >= next->iov_len) {
-      left -= next->iov_len;
-      ++next;
-      --count;
-    }
-    if (left > 0) {
-      next->iov_base = static_cast<char*>(next->iov_base) + left;
-      next->iov_len -= left;
-    }
-  }
-  return 0;
+  return brenvik::writeAll(file, std::span(pieces.data(), count));
 }
 
 }  // namespace
