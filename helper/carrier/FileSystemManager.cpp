@@ -18,8 +18,6 @@
 namespace brenvik {
 namespace {
 
-constexpr int kUnexplained = 5;    // the platform failed and did not say why
-constexpr int kPosixFailure = -1;  // what a POSIX call returned
 constexpr mode_t kDirectoryMode = 0755;
 constexpr std::size_t kPathBuffer = 1024;
 
