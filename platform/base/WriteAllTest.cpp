@@ -64,7 +64,9 @@ TEST(WriteAllTest, GoesOnAfterAShortWrite) {
   struct sigaction before {};
   ASSERT_EQ(::sigaction(SIGUSR1, &ignore, &before), 0);
   ASSERT_GT(::fcntl(pipe.to.get(), F_SETPIPE_SZ, 4096), 0);
-  std::string first(30'000, 'a'), second(30'001, 'b'), got;
+  std::string first, second, got;
+  for (int i = 0; i < 6000; ++i) first += std::to_string(i) + ' ';
+  for (int i = 6000; i < 12'000; ++i) second += std::to_string(i) + ' ';
   std::thread reader([&, writer = ::pthread_self()] {
     std::array<char, 1000> some;
     for (ssize_t size = 0; (size = ::read(pipe.from.get(), some.data(), some.size())) > 0;) {
