@@ -24,7 +24,7 @@ class RemoteContacts final : public ContactsService {
 
   // With a worker that cannot be had there is a manager, whose remap fails and says why: null would mean that
   // there are no contacts.
-  std::unique_ptr<ContactsChannelManager> makeChannelManager(bool* lackedMemory = nullptr) noexcept override;
+  std::unique_ptr<ContactsChannelManager> makeChannelManager() override;
 
  private:
   Worker& worker_;

@@ -108,52 +108,49 @@ RemoteVoicemailStore::Received RemoteVoicemailStore::ask(VoicemailRequest* reque
   return received == WorkerResult::closed ? Received::workerDied : Received::nothing;
 }
 
-bool RemoteVoicemailStore::perform(Operation operation, const std::string* key, const std::string* token,
-                                   std::optional<std::string>* found) noexcept {
-  if (found != nullptr) found->reset();
+std::optional<std::string> RemoteVoicemailStore::perform(Operation operation, const std::string* key,
+                                                         const std::string* token) {
   Result result = Result::outOfMemory;
-  bool isToldByWorker = false;
+  VoicemailAnswer answer;
   try {
     VoicemailRequest request;
     request.operation = operation;
     if (key != nullptr) request.key = *key;
     if (token != nullptr) request.token = *token;
-    VoicemailAnswer answer;
     result = exchange(&request, &answer);
-    isToldByWorker = result == Result::outOfMemory && answer.outcome == VoicemailOutcome::outOfMemory;
-    if (found != nullptr && result == Result::done) *found = std::move(answer.token);
   } catch (const std::bad_alloc&) {
     // What the worker says now answers nothing any more. The lack is this process's own.
     channel_.close();
+    answer = {};
   }
+  const bool isToldByWorker =
+      result == Result::outOfMemory && answer.outcome == VoicemailOutcome::outOfMemory;
   if (result != Result::done && !isToldByWorker) {
     if (stores::writes(operation))
       logUnified(LogLevel::error, "The voicemail store could not be written");
     else
       logUnified(LogLevel::error, "The voicemail store could not be read");
   }
-  return result != Result::outOfMemory;
+  if (result == Result::outOfMemory) throw std::bad_alloc();
+  return result == Result::done ? std::move(answer.token) : std::nullopt;
 }
 
-bool RemoteVoicemailStore::setToken(const std::string* token) noexcept {
-  return perform(token == nullptr ? Operation::clearToken : Operation::setToken, nullptr, token, nullptr);
+void RemoteVoicemailStore::setToken(const std::string* token) {
+  perform(token == nullptr ? Operation::clearToken : Operation::setToken, nullptr, token);
 }
 
-bool RemoteVoicemailStore::setTokenForKey(const std::string& key, const std::string& token) noexcept {
-  return perform(Operation::setTokenForKey, &key, &token, nullptr);
+void RemoteVoicemailStore::setTokenForKey(const std::string& key, const std::string& token) {
+  perform(Operation::setTokenForKey, &key, &token);
 }
 
-bool RemoteVoicemailStore::removeAllRecords() noexcept {
-  return perform(Operation::removeAllRecords, nullptr, nullptr, nullptr);
+void RemoteVoicemailStore::removeAllRecords() { perform(Operation::removeAllRecords, nullptr, nullptr); }
+
+std::optional<std::string> RemoteVoicemailStore::copyToken() {
+  return perform(Operation::readToken, nullptr, nullptr);
 }
 
-bool RemoteVoicemailStore::readToken(std::optional<std::string>* token) noexcept {
-  return perform(Operation::readToken, nullptr, nullptr, token);
-}
-
-bool RemoteVoicemailStore::readTokenForKey(const std::string& key,
-                                           std::optional<std::string>* token) noexcept {
-  return perform(Operation::readTokenForKey, &key, nullptr, token);
+std::optional<std::string> RemoteVoicemailStore::copyTokenForKey(const std::string& key) {
+  return perform(Operation::readTokenForKey, &key, nullptr);
 }
 
 }  // namespace brenvik
