@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/base/fakes/FailingMalloc.h"
 
+#include <cerrno>
 #include <cstddef>
 #include <utility>
 
@@ -11,6 +12,12 @@ namespace brenvik {
 namespace {
 
 constinit thread_local AllocationFailures failing;
+
+[[maybe_unused]] bool failsNow() noexcept {
+  if (!failing.takeTurn()) return false;
+  errno = ENOMEM;
+  return true;
+}
 
 }  // namespace
 
@@ -36,12 +43,12 @@ void* __libc_malloc(std::size_t size);
 void* __libc_calloc(std::size_t count, std::size_t size);
 void* __libc_realloc(void* memory, std::size_t size);
 // NOLINTEND(bugprone-reserved-identifier)
-void* malloc(std::size_t size) { return brenvik::failing.takeTurn() ? nullptr : __libc_malloc(size); }
+void* malloc(std::size_t size) { return brenvik::failsNow() ? nullptr : __libc_malloc(size); }
 void* calloc(std::size_t count, std::size_t size) {
-  return brenvik::failing.takeTurn() ? nullptr : __libc_calloc(count, size);
+  return brenvik::failsNow() ? nullptr : __libc_calloc(count, size);
 }
 void* realloc(void* memory, std::size_t size) {
-  return brenvik::failing.takeTurn() ? nullptr : __libc_realloc(memory, size);
+  return brenvik::failsNow() ? nullptr : __libc_realloc(memory, size);
 }
 }
 #endif
