@@ -14,7 +14,8 @@ class ServiceManager {
   // False: nobody listens, and showing is for nothing.
   virtual bool listens() const noexcept = 0;
   // Shows the line from now on. Does not wait; a line that cannot be sent is lost. Any thread.
-  virtual void show(const std::string& line) noexcept = 0;
+  // Throws std::bad_alloc.
+  virtual void show(const std::string& line) = 0;
 };
 
 }  // namespace brenvik

@@ -29,7 +29,7 @@ uInt clamped(std::size_t size) noexcept {
 }  // namespace
 
 GunzipResult ZlibGunzip::gunzip(std::span<const std::byte> input, std::uint64_t largestOutput,
-                                const Receiver& receiver) noexcept try {
+                                const Receiver& receiver) {
   z_stream stream{};
   if (::inflateInit2(&stream, kGzipWrapper) != Z_OK) return GunzipResult::outOfMemory;
   const std::unique_ptr<z_stream, InflateEnd> owned(&stream);
@@ -60,8 +60,6 @@ GunzipResult ZlibGunzip::gunzip(std::span<const std::byte> input, std::uint64_t 
       return GunzipResult::truncated;
     }
   }
-} catch (...) {
-  return GunzipResult::outOfMemory;
 }
 
 GunzipOutcome ZlibGunzip::gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
@@ -79,7 +77,7 @@ GunzipOutcome ZlibGunzip::gunzipInto(const GunzipInput& input, int file, std::ui
     return outcome.writeError == 0 && (!mayGoOn || mayGoOn());
   });
   return outcome;
-} catch (...) {
+} catch (const std::bad_alloc&) {
   return {GunzipResult::outOfMemory, 0, 0};
 }
 

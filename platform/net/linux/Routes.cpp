@@ -162,7 +162,7 @@ void collect(const rtmsg& route, std::span<const std::byte> attributes, unsigned
 
 }  // namespace
 
-std::optional<unsigned> interfaceTo(const sockaddr& peer) noexcept try {
+std::optional<unsigned> interfaceTo(const sockaddr& peer) {
   std::array<std::byte, 16> address{};
   std::size_t length = 0;
   auto family = static_cast<std::uint8_t>(peer.sa_family);
@@ -200,11 +200,9 @@ std::optional<unsigned> interfaceTo(const sockaddr& peer) noexcept try {
     });
   });
   return answered ? found : std::nullopt;
-} catch (...) {
-  return std::nullopt;  // out of memory
 }
 
-std::optional<std::set<unsigned>> interfacesWithRoutes() noexcept try {
+std::optional<std::set<unsigned>> interfacesWithRoutes() {
   std::set<unsigned> interfaces;
   const unsigned loopback = ::if_nametoindex("lo");
   bool answered = false;
@@ -217,8 +215,6 @@ std::optional<std::set<unsigned>> interfacesWithRoutes() noexcept try {
   }
   if (!answered) return std::nullopt;
   return interfaces;
-} catch (...) {
-  return std::nullopt;  // out of memory
 }
 
 }  // namespace brenvik
