@@ -87,14 +87,14 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
 
   // Reads the version records of the types in the mask; bits that are no type are ignored.
   //
-  // VersionSource::preferences: `source` is the preferences domain. Each type gets its record, or none when
-  // there is no dictionary; earlier entries of these types go. Always returns 0.
+  // VersionSource::preferences: `source` is the preferences domain. Each type gets its record, or none
+  // when there is no dictionary; earlier entries of these types go. Always returns 0.
+  //
   // VersionSource::manifest: `source` is the manifest's URL. Blocks until the HTTP client is done. Returns
-  //   kNotFetched  when the manifest could not be fetched
-  //   0            when no type needs an update; a manifest that is no dictionary counts as that, and is
-  //   logged a mask       of the types that need one, whose entries are then the server's
-  // A type for which memory does not suffice is left out of the mask and noted by itself. Throws
-  // std::bad_alloc when memory does not suffice for the manifest.
+  // kNotFetched when the manifest could not be fetched. Returns 0 when no type needs an update; a manifest
+  // that is no dictionary is logged and counts as that. Else returns the mask of the types that need an
+  // update; their entries are the server's then. A type for which memory does not suffice is left out of the
+  // mask and noted by itself. Throws std::bad_alloc when memory does not suffice for the manifest.
   std::int64_t loadVersions(const std::string& source, VersionSource kind, std::uint32_t mask);
   // The second half of the above: returns the mask of the types whose entry in the manifest is new, and keeps
   // copies of these entries; nothing of the manifest itself is kept.

@@ -17,9 +17,9 @@ struct PasswordEntry {
 };
 
 // Look an account up. Return 0, or the error of the look-up: ENOMEM, EMFILE or ENFILE when this process lacks
-// memory or descriptors, anything else means what the system's database means by it. *entry has no value
-// unless the account was found; with 0, that says there is no such account. Any thread; they may wait for
-// whatever the system keeps its accounts in. Throw std::bad_alloc.
+// memory or descriptors, another value is the database's own. *entry has a value only if the account was
+// found; 0 and no value means that there is no such account. Any thread; a call may wait for the service that
+// the system keeps its accounts in. Both throw std::bad_alloc.
 int readPasswordEntry(const char* name, std::optional<PasswordEntry>* entry);
 int readPasswordEntry(uid_t uid, std::optional<PasswordEntry>* entry);
 

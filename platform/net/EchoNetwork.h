@@ -26,9 +26,9 @@ class EchoSocket {
  public:
   virtual ~EchoSocket() = default;
 
-  // Does what it can; nothing is told.
+  // Best effort: a failure is not reported.
   virtual void setReceiveBufferSize(int bytes) = 0;
-  // Lets packets out and in by this interface only. Does what it can; nothing is told.
+  // Lets packets out and in by this interface only. Best effort: a failure is not reported.
   virtual void bindToInterface(unsigned index) = 0;
   // How long receive() waits. 0, or the error's number.
   virtual int setReceiveTimeOut(std::chrono::microseconds timeOut) = 0;

@@ -16,7 +16,7 @@
 namespace brenvik {
 namespace {
 
-constexpr int kMaxLinks = 40;  // as the kernel follows on one way
+constexpr int kMaxLinks = 40;  // the kernel's limit for one path
 
 bool isOwn(const struct stat& info) { return info.st_uid == 0 || info.st_uid == ::geteuid(); }
 

@@ -29,7 +29,7 @@ class PublicAddressFinder : public std::enable_shared_from_this<PublicAddressFin
   // thread.
   using MakeNetwork = std::function<std::unique_ptr<StunNetwork>(int stopFd)>;
 
-  // The queues outlive it, or its stop(). Throws OutOfQueues, here for want of a descriptor.
+  // The queues outlive it, or its stop(). Throws OutOfQueues when no descriptor is left.
   PublicAddressFinder(MakeNetwork makeNetwork, WorkQueues& queues);
 
   // Any thread. An error where there is no thread at all; that comes from within the call.
