@@ -2,10 +2,10 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "helper/voicemail/VoicemailOperations.h"
 
-#include <exception>
 #include <optional>
 #include <string>
 
+#include "platform/base/Guarded.h"
 #include "platform/base/Utf8.h"
 
 namespace brenvik {
@@ -23,16 +23,6 @@ void writeToken(const std::optional<std::string>& token, char* field) {
   field[0] = '\0';
   if (!token || token->size() >= VoicemailOperations::kField || !isValidUtf8(*token)) return;
   field[token->copy(field, token->size())] = '\0';
-}
-
-// Runs `work`; the routine's status is `onFailure` when memory does not suffice for it.
-template <typename Work>
-KernelReturn guarded(KernelReturn onFailure, Work work) noexcept {
-  try {
-    return work();
-  } catch (const std::exception&) {
-    return onFailure;
-  }
 }
 
 }  // namespace

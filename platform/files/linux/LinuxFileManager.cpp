@@ -12,6 +12,7 @@
 #include <cstdio>
 #include <new>
 
+#include "platform/base/Guarded.h"
 #include "platform/base/PasswordEntry.h"
 #include "platform/base/WriteAll.h"
 #include "platform/files/linux/DirectoryNames.h"
@@ -25,15 +26,11 @@
 namespace brenvik {
 namespace {
 
-// Runs `work`, which answers 0 or an errno value, at the boundary that nothing is thrown across.
+// Runs `work`, which returns 0 or an errno value.
 template <typename Work>
-FileOutcome guarded(Work work) noexcept {
-  try {
-    const int error = work();
-    return error == 0 ? FileOutcome::success() : FileOutcome::failure(error);
-  } catch (const std::bad_alloc&) {
-    return FileOutcome::failure(ENOMEM);
-  }
+FileOutcome outcomeOf(Work work) noexcept {
+  const int error = guarded(ENOMEM, work);
+  return error == 0 ? FileOutcome::success() : FileOutcome::failure(error);
 }
 
 bool isSameItem(const struct stat& a, const struct stat& b) {
@@ -256,7 +253,7 @@ FileContents& LinuxFileManager::contents() {
 
 bool LinuxFileManager::itemExists(const std::string& path, bool* isDirectory) noexcept {
   struct stat info {};
-  const bool exists = guarded([&] {
+  const bool exists = outcomeOf([&] {
                         UniqueFd item;
                         if (const int error = openToRead(path, O_PATH, &item); error != 0) return error;
                         return ::fstat(item.get(), &info) == 0 ? 0 : errno;
@@ -446,18 +443,19 @@ int LinuxFileManager::move(const std::string& source, const std::string& destina
 
 FileOutcome LinuxFileManager::copyItem(const std::string& source, const std::string& destination,
                                        IfPresent ifPresent, Durability durability, Gift* gift) noexcept {
-  const FileOutcome outcome = guarded([&] { return copy(source, destination, ifPresent, durability, gift); });
+  const FileOutcome outcome =
+      outcomeOf([&] { return copy(source, destination, ifPresent, durability, gift); });
   if (gift != nullptr && !outcome.succeeded()) gift->outcome = outcome;
   return outcome;
 }
 
 FileOutcome LinuxFileManager::moveItem(const std::string& source, const std::string& destination,
                                        IfPresent ifPresent, Durability durability) noexcept {
-  return guarded([&] { return move(source, destination, ifPresent, durability); });
+  return outcomeOf([&] { return move(source, destination, ifPresent, durability); });
 }
 
 FileOutcome LinuxFileManager::removeItem(const std::string& path) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     Place place;
     const int error = Place::open(path, &place);
     return error != 0 ? error : removeTree(place.directory.get(), place.name.c_str());
@@ -465,7 +463,7 @@ FileOutcome LinuxFileManager::removeItem(const std::string& path) noexcept {
 }
 
 FileOutcome LinuxFileManager::removeEntry(const std::string& path) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     Place place;
     if (const int error = openPlace(path, &place); error != 0) return error;
     const int directory = place.directory.get();
@@ -480,7 +478,7 @@ FileOutcome LinuxFileManager::removeEntry(const std::string& path) noexcept {
 }
 
 FileOutcome LinuxFileManager::placeLink(const std::string& path, const std::string& target) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     if (path.ends_with('/')) return ENOTDIR;  // no link has such a name
     Place place;
     if (const int error = openPlace(path, &place); error != 0) return error;
@@ -490,7 +488,7 @@ FileOutcome LinuxFileManager::placeLink(const std::string& path, const std::stri
 }
 
 FileOutcome LinuxFileManager::syncItem(const std::string& path) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     Place place;
     if (const int error = Place::openExisting(path, &place, Links::unchangeable); error != 0) return error;
     struct stat info {};
@@ -508,7 +506,7 @@ FileOutcome LinuxFileManager::syncItem(const std::string& path) noexcept {
 
 FileOutcome LinuxFileManager::createDirectory(const std::string& path, const DirectoryAttributes& attributes,
                                               Intermediates intermediates) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     ResolvedAttributes resolved{attributes.mode & 07777};
     if (!attributes.ownerName.empty()) {
       if (const int error = idOfUser(attributes.ownerName, &resolved.uid); error != 0) return error;
@@ -523,7 +521,7 @@ FileOutcome LinuxFileManager::createDirectory(const std::string& path, const Dir
 
 FileOutcome LinuxFileManager::listDirectory(const std::string& path,
                                             std::vector<std::string>* names) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     UniqueFd directory;
     if (const int error = openToRead(path, O_RDONLY | O_DIRECTORY, &directory); error != 0) return error;
     DirectoryNames entries;
@@ -535,7 +533,7 @@ FileOutcome LinuxFileManager::listDirectory(const std::string& path,
 }
 
 FileOutcome LinuxFileManager::enumerateBelow(const std::string& path, ItemVisitor& visitor) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     UniqueFd top;
     if (const int error = openDirectory(path, &top, Links::own); error != 0) return error;
     UniqueFd names = openForNames(top.get());
@@ -564,16 +562,16 @@ int LinuxFileManager::change(const std::string& path, const ItemAttributes& attr
 
 FileOutcome LinuxFileManager::setAttributes(const std::string& path, const ItemAttributes& attributes,
                                             ItemKinds kinds) noexcept {
-  return guarded([&] { return change(path, attributes, kinds, Reach::item); });
+  return outcomeOf([&] { return change(path, attributes, kinds, Reach::item); });
 }
 
 FileOutcome LinuxFileManager::setAttributesOfTree(const std::string& path,
                                                   const ItemAttributes& attributes) noexcept {
-  return guarded([&] { return change(path, attributes, ItemKinds::all, Reach::tree); });
+  return outcomeOf([&] { return change(path, attributes, ItemKinds::all, Reach::tree); });
 }
 
 std::optional<std::string> LinuxFileManager::readFile(const std::string& path, std::size_t limit) noexcept {
-  try {
+  return guarded(std::optional<std::string>(), [&]() -> std::optional<std::string> {
     UniqueFd file;
     struct stat info {};
     if (openToRead(path, O_RDONLY | O_NONBLOCK | O_NOCTTY, &file) != 0) return std::nullopt;
@@ -597,13 +595,11 @@ std::optional<std::string> LinuxFileManager::readFile(const std::string& path, s
     if (length > limit) return std::nullopt;
     bytes.resize(length);
     return bytes;
-  } catch (const std::bad_alloc&) {
-    return std::nullopt;
-  }
+  });
 }
 
 bool LinuxFileManager::writeFileAtomically(const std::string& path, std::string_view bytes) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
            Place place;
            if (const int error = openPlace(path, &place); error != 0) return error;
            struct stat there {};
@@ -628,7 +624,7 @@ bool LinuxFileManager::writeFileAtomically(const std::string& path, std::string_
 }
 
 bool LinuxFileManager::writeFile(const std::string& path, std::string_view bytes) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
            Place place;
            if (const int error = openPlace(path, &place); error != 0) return error;
            const UniqueFd file(::openat(place.directory.get(), place.name.c_str(),
