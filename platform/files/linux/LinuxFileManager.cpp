@@ -570,31 +570,41 @@ FileOutcome LinuxFileManager::setAttributesOfTree(const std::string& path,
   return outcomeOf([&] { return change(path, attributes, ItemKinds::all, Reach::tree); });
 }
 
+namespace {
+
+// All of the file, which says that it has `size` bytes; nothing when it has more than `limit` or cannot be
+// read.
+std::optional<std::string> readAll(int file, std::size_t size, std::size_t limit) {
+  std::string bytes;
+  // One byte more than it should have: the read that gets nothing ends it. Some files say they are empty.
+  std::size_t length = 0;
+  bytes.resize(size + 1);
+  for (;;) {
+    if (length == bytes.size()) {
+      if (length > limit) return std::nullopt;
+      bytes.resize(length + 65536);
+    }
+    const ssize_t got = ::read(file, bytes.data() + length, bytes.size() - length);
+    if (got < 0 && errno == EINTR) continue;
+    if (got < 0) return std::nullopt;
+    if (got == 0) break;
+    length += static_cast<std::size_t>(got);
+  }
+  if (length > limit) return std::nullopt;
+  bytes.resize(length);
+  return bytes;
+}
+
+}  // namespace
+
 std::optional<std::string> LinuxFileManager::readFile(const std::string& path, std::size_t limit) noexcept {
   return guarded(std::optional<std::string>(), [&]() -> std::optional<std::string> {
     UniqueFd file;
     struct stat info {};
     if (openToRead(path, O_RDONLY | O_NONBLOCK | O_NOCTTY, &file) != 0) return std::nullopt;
     if (::fstat(file.get(), &info) != 0 || !S_ISREG(info.st_mode)) return std::nullopt;
-    if (static_cast<std::size_t>(info.st_size) > limit) return std::nullopt;
-    std::string bytes;
-    // One byte more than it should have: the read that gets nothing ends it. Some files say they are empty.
-    std::size_t length = 0;
-    bytes.resize(static_cast<std::size_t>(info.st_size) + 1);
-    for (;;) {
-      if (length == bytes.size()) {
-        if (length > limit) return std::nullopt;
-        bytes.resize(length + 65536);
-      }
-      const ssize_t got = ::read(file.get(), bytes.data() + length, bytes.size() - length);
-      if (got < 0 && errno == EINTR) continue;
-      if (got < 0) return std::nullopt;
-      if (got == 0) break;
-      length += static_cast<std::size_t>(got);
-    }
-    if (length > limit) return std::nullopt;
-    bytes.resize(length);
-    return bytes;
+    const auto size = static_cast<std::size_t>(info.st_size);
+    return size > limit ? std::nullopt : readAll(file.get(), size, limit);
   });
 }
 
