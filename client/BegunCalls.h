@@ -32,7 +32,7 @@ struct BegunCall {
   bvmh_call publicNumber() const noexcept { return isBlocking ? 0 : result.call; }
 
   std::vector<std::byte> message;
-  std::array<std::vector<std::byte>, kMostRegions> regions;
+  std::array<std::vector<std::byte>, kMaxRegions> regions;
   bvmh_result result{};
 };
 

@@ -24,7 +24,7 @@ void takeDescriptors(const cmsghdr& control, Incoming* incoming) noexcept {
     std::memcpy(&number, CMSG_DATA(&control) + at, sizeof number);
     UniqueFd descriptor(number);
     if (control.cmsg_type != SCM_RIGHTS) continue;
-    if (incoming->descriptorCount == kMostDescriptors) {
+    if (incoming->descriptorCount == kMaxDescriptors) {
       incoming->isCut = true;
       continue;
     }
@@ -70,7 +70,7 @@ Io waitFor(int descriptor, short events, Deadline deadline) noexcept {
 
 Io sendMessage(int socket, std::span<const iovec> parts, std::span<const int> descriptors, Deadline deadline,
                Waiting* next) noexcept {
-  alignas(cmsghdr) std::array<std::byte, CMSG_SPACE(kMostDescriptors * sizeof(int))> control{};
+  alignas(cmsghdr) std::array<std::byte, CMSG_SPACE(kMaxDescriptors * sizeof(int))> control{};
   msghdr message{};
   message.msg_iov = const_cast<iovec*>(parts.data());  // sendmsg only reads them
   message.msg_iovlen = parts.size();
@@ -102,7 +102,7 @@ Io receiveMessage(int socket, std::span<std::byte> buffer, Deadline deadline, Wa
       if (const Io waited = waitFor(socket, POLLIN, deadline); waited != Io::done) return waited;
     }
     // Room for the rights of a message and for credentials and a pidfd, should the peer have asked for them.
-    alignas(cmsghdr) std::array<std::byte, CMSG_SPACE(kMostDescriptors * sizeof(int)) +
+    alignas(cmsghdr) std::array<std::byte, CMSG_SPACE(kMaxDescriptors * sizeof(int)) +
                                                CMSG_SPACE(sizeof(ucred)) + CMSG_SPACE(sizeof(int))>
         control;
     iovec part{buffer.data(), buffer.size()};

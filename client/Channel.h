@@ -45,12 +45,12 @@ enum class Io : std::uint8_t {
 };
 
 // More than any message of the protocol carries.
-inline constexpr std::size_t kMostDescriptors = 4;
+inline constexpr std::size_t kMaxDescriptors = 4;
 
 struct Incoming {
   std::size_t length = 0;
   bool isCut = false;  // bytes or control data did not fit: no correct message
-  std::array<UniqueFd, kMostDescriptors> descriptors;
+  std::array<UniqueFd, kMaxDescriptors> descriptors;
   std::size_t descriptorCount = 0;
 };
 

@@ -18,7 +18,7 @@ namespace {
 
 // Check-in is tried again after 1, 2, 4 ... 512 ms: about a second, the time a helper needs many times over
 // to be started anew.
-constexpr std::uint32_t kMostTries = 11;
+constexpr std::uint32_t kMaxTries = 11;
 
 // A full backlog tells nobody when there is room again, so it is looked at every few milliseconds.
 constexpr std::uint32_t kLongestKnockPause = 16;
@@ -93,7 +93,7 @@ std::optional<std::int32_t> CheckIn::tryEnded(std::int32_t code) noexcept {
   // missing for a moment then, which says nothing at the first try but that there is no helper.
   const bool hasLeft = code == BVMH_ERROR_HELPER_GONE;
   const bool isBetweenLives = hadLeft_ && code == BVMH_ERROR_UNREACHABLE;
-  if ((!hasLeft && !isBetweenLives) || tries_ == kMostTries) return code;
+  if ((!hasLeft && !isBetweenLives) || tries_ == kMaxTries) return code;
   hadLeft_ = true;
   channel_ = Channel{};
   step_ = Step::pause;

@@ -171,7 +171,7 @@ void Client::sendWaiting() noexcept {
       finish(call, BVMH_OK);
       continue;
     }
-    std::array<std::span<const std::byte>, kMostRegions> regions;
+    std::array<std::span<const std::byte>, kMaxRegions> regions;
     for (std::size_t i = 0; i < call.routine->descriptors; ++i) regions[i] = call.regions[i];
     Outgoing request;
     if (!request.lay(call.message, std::span(regions).first(call.routine->descriptors))) {

@@ -26,7 +26,7 @@ constexpr int kBacklog = 16;
 
 // How many connections and broken messages are still dealt with when the time is over already, so that
 // neither a flood nor a time-out of 0 makes the other useless.
-constexpr int kMostOvertime = 64;
+constexpr int kMaxOvertime = 64;
 
 // Events of the services carry 0 and 1, those of a connection its index and this.
 constexpr std::uint64_t kFirstConnectionKey = 2;
@@ -256,7 +256,7 @@ std::int32_t Listener::next(Deadline deadline, bvmh_event* event) noexcept {
   *event = bvmh_event{};
   systemError_ = 0;
   for (int overtime = 0;; overtime += deadline.hasPassed() ? 1 : 0) {
-    if (overtime > kMostOvertime) return BVMH_ERROR_TIMED_OUT;
+    if (overtime > kMaxOvertime) return BVMH_ERROR_TIMED_OUT;
     epoll_event ready{};
     const int count = ::epoll_wait(poll_.get(), &ready, 1, deadline.millisecondsForPoll());
     if (count < 0 && errno != EINTR) return systemFailure();

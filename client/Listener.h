@@ -59,7 +59,7 @@ class Listener {
  private:
   enum class Service : std::uint8_t { pushes, notifications };
   // The helper opens a connection for each push or notification, so few are ever open at once.
-  static constexpr std::size_t kMostConnections = 32;
+  static constexpr std::size_t kMaxConnections = 32;
 
   struct Connection {
     UniqueFd socket;
@@ -86,7 +86,7 @@ class Listener {
   UniqueFd names_;  // an inotify of the files that services_ made, if the system has one left
   std::array<ServiceSocket, 2> services_;
   std::array<bool, 2> hasLostName_{};
-  std::array<Connection, kMostConnections> connections_;
+  std::array<Connection, kMaxConnections> connections_;
   std::uint64_t lastSerial_ = 0;
   uid_t allowedUid_ = 0;  // beside the superuser and our own
   int systemError_ = 0;

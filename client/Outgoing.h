@@ -13,7 +13,7 @@
 namespace brenvik::client {
 
 // No routine has more descriptors.
-inline constexpr std::size_t kMostRegions = 2;
+inline constexpr std::size_t kMaxRegions = 2;
 
 using Regions = std::span<const std::span<const std::byte>>;
 
@@ -30,10 +30,10 @@ class Outgoing {
   }
 
  private:
-  std::array<iovec, 1 + 2 * kMostRegions> parts_;
+  std::array<iovec, 1 + 2 * kMaxRegions> parts_;
   std::size_t partCount_ = 0;
-  std::array<UniqueFd, kMostRegions> memories_;
-  std::array<int, kMostRegions> descriptors_{};
+  std::array<UniqueFd, kMaxRegions> memories_;
+  std::array<int, kMaxRegions> descriptors_{};
   std::size_t descriptorCount_ = 0;
 };
 

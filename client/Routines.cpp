@@ -91,7 +91,7 @@ class Call {
 
   bvmh_client* client_;
   const RoutineFacts& routine_;
-  std::array<std::span<const std::byte>, kMostRegions> regions_;
+  std::array<std::span<const std::byte>, kMaxRegions> regions_;
   std::size_t regionCount_ = 0;
   bool isValid_ = true;
   bvmh_result result_;  // written by a call that succeeds

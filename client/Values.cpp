@@ -34,7 +34,7 @@ struct bvmh_value {
 namespace {
 
 constexpr double kUnixTimeOf2001 = 978307200;
-constexpr std::size_t kLeastTidied = 64;
+constexpr std::size_t kMinTidied = 64;
 
 using Type = PropertyList::Type;
 
@@ -83,7 +83,7 @@ void beginChange(bvmh_value& handle) {
     handle.entries.reserve(count + 1);
     for (std::size_t i = 0; i < count; ++i)
       handle.entries.emplace_back(std::string(handle.value.keyAt(i)), handle.value.at(i));
-    handle.tidyAt = std::max(kLeastTidied, 2 * count);
+    handle.tidyAt = std::max(kMinTidied, 2 * count);
   }
   handle.isChanged = true;
 }

@@ -144,7 +144,7 @@ int32_t bvmh_begin(bvmh_client* client, int32_t message_id, const void* request,
   std::array<std::byte, client::kLargestRequest> copy;
   const std::span<std::byte> message = std::span(copy).first(size);
   std::memcpy(message.data(), request, size);
-  std::array<std::span<const std::byte>, client::kMostRegions> parts;
+  std::array<std::span<const std::byte>, client::kMaxRegions> parts;
   for (std::size_t i = 0; i < region_count; ++i) {
     if ((regions[i].bytes == nullptr && regions[i].size != 0) || regions[i].size > UINT32_MAX)
       return BVMH_ERROR_INVALID_ARGUMENT;

@@ -21,7 +21,7 @@ namespace brenvik::client {
 namespace {
 
 constexpr int kPatience = 60'000;  // milliseconds; only a broken client makes a script wait so long
-constexpr std::size_t kMostDescriptors = 16;
+constexpr std::size_t kMaxDescriptors = 16;
 
 [[noreturn]] void fail(const char* what) { throw std::system_error(errno, std::generic_category(), what); }
 
@@ -128,7 +128,7 @@ UniqueFd Script::accept() {
 Message Script::receive(const UniqueFd& channel) {
   awaitInput(channel.get(), "a message");
   std::string data(70'000, '\0');
-  alignas(cmsghdr) char control[CMSG_SPACE(kMostDescriptors * sizeof(int))];
+  alignas(cmsghdr) char control[CMSG_SPACE(kMaxDescriptors * sizeof(int))];
   iovec part{data.data(), data.size()};
   msghdr header{};
   header.msg_iov = &part;
@@ -158,7 +158,7 @@ void Script::expectEnd(const UniqueFd& channel) {
 }
 
 bool Script::send(const UniqueFd& channel, const Bytes& bytes, const std::vector<int>& descriptors) {
-  alignas(cmsghdr) char control[CMSG_SPACE(kMostDescriptors * sizeof(int))] = {};
+  alignas(cmsghdr) char control[CMSG_SPACE(kMaxDescriptors * sizeof(int))] = {};
   iovec part{const_cast<char*>(bytes.string().data()), bytes.size()};
   msghdr header{};
   header.msg_iov = &part;

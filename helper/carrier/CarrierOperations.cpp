@@ -3,9 +3,9 @@
 #include "helper/carrier/CarrierOperations.h"
 
 #include <cerrno>
-#include <exception>
 #include <string>
 
+#include "platform/base/Guarded.h"
 #include "platform/base/Utf8.h"
 #include "platform/log/Log.h"
 
@@ -16,16 +16,6 @@ constexpr mode_t kBundlesDirectoryMode = 0755;
 constexpr const char* kCrashLogs = "Library/Logs/CrashReporter/";
 
 void terminate(char* field, std::size_t size) { field[size - 1] = '\0'; }
-
-// The routines' own boundary: nothing is thrown past it.
-template <typename Work>
-KernelReturn guarded(KernelReturn onException, Work work) noexcept {
-  try {
-    return work();
-  } catch (const std::exception&) {
-    return onException;
-  }
-}
 
 }  // namespace
 

@@ -15,23 +15,13 @@
 #include <new>
 #include <span>
 
+#include "platform/base/Guarded.h"
+
 namespace brenvik {
 namespace {
 
-constexpr int kUnexplained = 5;    // the platform failed and did not say why
-constexpr int kPosixFailure = -1;  // what a POSIX call returned
 constexpr mode_t kDirectoryMode = 0755;
 constexpr std::size_t kPathBuffer = 1024;
-
-// Runs work that may run out of memory, at the boundary that nothing is thrown across.
-template <typename Result, typename Work>
-Result guarded(Result onExhaustion, Work work) noexcept {
-  try {
-    return work();
-  } catch (const std::bad_alloc&) {
-    return onExhaustion;
-  }
-}
 
 // The path as it fits a fixed buffer: cut, and terminated.
 std::array<char, kPathBuffer> cutCopy(const std::string& path) {

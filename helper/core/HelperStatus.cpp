@@ -89,7 +89,7 @@ StatusReport HelperStatus::report() const {
 std::string HelperStatus::line() const {
   const StatusReport now = report();
   std::string text;
-  for (const std::string& each : whatHolds(now)) text += (text.empty() ? "" : ", ") + each;
+  for (const std::string& each : busyReasons(now)) text += (text.empty() ? "" : ", ") + each;
   if (!text.empty()) return "Kept by " + text;
   return now.leavesIn ? "Idle, leaves soon" : "Waits for its first client";
 }

@@ -26,7 +26,7 @@ class RefusalLog {
   using Clock = std::function<std::chrono::nanoseconds()>;
 
   static constexpr std::chrono::minutes kInterval{1};
-  static constexpr std::size_t kMostCallers = 64;
+  static constexpr std::size_t kMaxCallers = 64;
 
   explicit RefusalLog(Clock now) : now_(std::move(now)) {}
 
@@ -60,7 +60,7 @@ class RefusalLog {
   std::mutex mutex_;
   std::optional<Others> others_;
   std::size_t count_ = 0;
-  std::array<Account, kMostCallers> callers_;  // last: pages that nobody touches until somebody is refused
+  std::array<Account, kMaxCallers> callers_;  // last: pages that nobody touches until somebody is refused
 };
 
 }  // namespace brenvik

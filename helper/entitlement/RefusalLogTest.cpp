@@ -95,7 +95,7 @@ TEST_F(RefusalLogTest, AtTheEndTheNumbersThatWereNotToldAre) {
 
 TEST_F(RefusalLogTest, ManyCallersAreRememberedOnlyUpToALimitAndTheOthersCountAsOne) {
   const auto stranger = [](std::size_t i) { return LogCaller{7, static_cast<uid_t>(i), "/x", ""}; };
-  constexpr std::size_t kMany = RefusalLog::kMostCallers;
+  constexpr std::size_t kMany = RefusalLog::kMaxCallers;
   for (std::size_t i = 0; i < 10 * kMany; ++i) refuse(stranger(i));
   EXPECT_EQ(log.entries().size(), kMany + 1) << "one line for all that are too many";
   log.clear();
@@ -117,11 +117,11 @@ TEST_F(RefusalLogTest, ManyCallersAreRememberedOnlyUpToALimitAndTheOthersCountAs
 
 TEST_F(RefusalLogTest, NumbersOfThoseThatAreForgottenAndOfAllOthersAreToldInTime) {
   const auto stranger = [](std::size_t i) { return LogCaller{7, static_cast<uid_t>(i), "/x", ""}; };
-  for (std::size_t i = 0; i < RefusalLog::kMostCallers; ++i) refuse(stranger(i));
+  for (std::size_t i = 0; i < RefusalLog::kMaxCallers; ++i) refuse(stranger(i));
   refuse(stranger(0));
   for (std::size_t i = 0; i < 4; ++i) refuse(stranger(2000 + i));
   now += seconds(60);
-  for (std::size_t i = 1; i < RefusalLog::kMostCallers; ++i) refuse(stranger(i));
+  for (std::size_t i = 1; i < RefusalLog::kMaxCallers; ++i) refuse(stranger(i));
   log.clear();
   refuse(stranger(1000));  // takes the place of the only one of long ago
   EXPECT_EQ(log.entries().front(), line("refused 1 more check-ins of account 0, executable /x"));

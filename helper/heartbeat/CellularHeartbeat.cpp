@@ -91,7 +91,7 @@ void CellularHeartbeat::stop(ServerContext& server) {
   (void)ReleaseBusyToken(server_ != nullptr ? *server_ : server, std::exchange(busyToken_, 0));
 }
 
-int CellularHeartbeat::ping() noexcept {
+int CellularHeartbeat::ping() noexcept try {
   std::array<char, kAddressTextSize> address{};
   if (parts_->address.size() >= address.size() || !isValidUtf8(parts_->address)) return EINVAL;
   std::copy(parts_->address.begin(), parts_->address.end(), address.begin());
@@ -143,6 +143,8 @@ int CellularHeartbeat::ping() noexcept {
     }
     if (time - *begin >= 1s) return ETIMEDOUT;
   }
+} catch (const std::bad_alloc&) {
+  return ENOMEM;
 }
 
 }  // namespace brenvik

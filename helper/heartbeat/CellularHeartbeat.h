@@ -58,7 +58,7 @@ class CellularHeartbeat {
   Traffic received() const noexcept { return received_.read(); }
 
   // One probe, up to two seconds: sends a request and waits for its reply. 0, or what went wrong as an errno
-  // number. On the heartbeat's queue, or with none running.
+  // number; ENOMEM when memory did not suffice. On the heartbeat's queue, or with none running.
   int ping() noexcept;
 
  private:

@@ -98,6 +98,14 @@ TEST_F(CellularHeartbeatTest, WhatGoesOutAndComesBackIsCounted) {
   EXPECT_EQ(heartbeat.sent().packets, 2U);
 }
 
+TEST_F(CellularHeartbeatTest, AProbeThatMemoryDoesNotSufficeForEndsAndTheNextOneGoesOut) {
+  network.isWithoutMemory = true;
+  EXPECT_EQ(heartbeat.ping(), ENOMEM);
+  network.isWithoutMemory = false;
+  EXPECT_EQ(heartbeat.ping(), ETIMEDOUT);
+  EXPECT_EQ(network.sent.size(), 1U);
+}
+
 TEST_F(CellularHeartbeatTest, WhetherItIsOnIsTold) {
   EXPECT_FALSE(heartbeat.isOn());
   heartbeat.setHeartbeat(server, true);

@@ -6,6 +6,7 @@
 #include <array>
 #include <cstddef>
 #include <memory>
+#include <new>
 #include <optional>
 #include <string>
 
@@ -34,9 +35,10 @@ KernelReturn ChannelRemap::RemapContactsChannel(const char* from, const char* to
 
 bool ChannelRemap::remapChannelIdentifier(const char* from, const char* to) noexcept {
   logUnified(LogLevel::standard, "remapChannelIdentifier %s -> %s", from, to);
-  bool lackedMemory = false;
-  const std::unique_ptr<ContactsChannelManager> manager = contacts_.makeChannelManager(&lackedMemory);
-  if (lackedMemory) {
+  std::unique_ptr<ContactsChannelManager> manager;
+  try {
+    manager = contacts_.makeChannelManager();
+  } catch (const std::bad_alloc&) {
     // Not the system without contacts that the lines below are about.
     logUnified(LogLevel::standard, "remapChannelIdentifier result: %s : %s", "failure", "out of memory");
     return false;

@@ -19,8 +19,8 @@ class ChannelRemap {
   // or 0.
   KernelReturn RemapContactsChannel(const char* from, const char* to, std::uint8_t* success) noexcept;
 
-  // Moves every contact's reference from one channel to the other. The texts are NUL-terminated. True, too,
-  // when the contacts cannot be reached.
+  // Moves every contact's reference from one channel to the other. The texts are NUL-terminated. Returns true
+  // if that was done, and also if the contacts cannot be reached.
   bool remapChannelIdentifier(const char* from, const char* to) noexcept;
 
  private:

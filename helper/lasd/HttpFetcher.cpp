@@ -72,7 +72,7 @@ void tellWriteError(const std::string& path) {
 
 // What does not fit is unpacked so far all the same, to nowhere, so that somebody can be told how much room
 // it needs. A few seconds of work; a bomb ends there.
-constexpr std::uint64_t kMostCountedBeyondRoom = std::uint64_t{1} << 30;
+constexpr std::uint64_t kMaxCountedBeyondRoom = std::uint64_t{1} << 30;
 
 }  // namespace
 
@@ -177,7 +177,7 @@ bool HttpFetcher::uncompressInto(int file, const std::string& path) {
   const std::uint64_t reserve = diskReserve(disk.size);
   const std::uint64_t room = disk.available > reserve ? disk.available - reserve : 0;
   const auto [result, need, writeError] =
-      parts_.gunzip.gunzipInto({body_, body_.sealedMemory()}, file, room, room + kMostCountedBeyondRoom);
+      parts_.gunzip.gunzipInto({body_, body_.sealedMemory()}, file, room, room + kMaxCountedBeyondRoom);
   if (result == GunzipResult::refused) {
     errno = writeError;
     tellWriteError(path);

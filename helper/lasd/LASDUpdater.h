@@ -49,7 +49,8 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
     std::function<std::chrono::nanoseconds()> now = timeSinceBoot;
   };
   enum class VersionSource { preferences, manifest };
-  // loadVersions() could not fetch the manifest; as a mask, no set of types is that large.
+  // What loadVersions() returns when the manifest could not be fetched. Types are the bits 1 to 16, so this
+  // is never a mask of them.
   static constexpr std::int64_t kNotFetched = 0xFFFFFFFF;
 
   LASDUpdater() noexcept = default;
@@ -84,16 +85,25 @@ class LASDUpdater : public std::enable_shared_from_this<LASDUpdater> {
 
   // ---- on the queue, or with none running ----
 
-  // Reads the version records of the types in the mask, from the preferences domain or by the manifest's URL.
-  // Of the manifest: the mask of the types that need an update, whose entries are then the server's; 0 too
-  // when it is no manifest; kNotFetched. Of the preferences: 0. Throws std::bad_alloc where memory does not
-  // suffice for the manifest.
+  // Reads the version records of the types in the mask; bits that are no type are ignored.
+  //
+  // VersionSource::preferences: `source` is the preferences domain. Each type gets its record, or none
+  // when there is no dictionary; earlier entries of these types go. Always returns 0.
+  //
+  // VersionSource::manifest: `source` is the manifest's URL. Blocks until the HTTP client is done. Returns
+  // kNotFetched when the manifest could not be fetched. Returns 0 when no type needs an update; a manifest
+  // that is no dictionary is logged and counts as that. Else returns the mask of the types that need an
+  // update; their entries are the server's then. A type for which memory does not suffice is left out of the
+  // mask and noted by itself. Throws std::bad_alloc when memory does not suffice for the manifest.
   std::int64_t loadVersions(const std::string& source, VersionSource kind, std::uint32_t mask);
-  // The second half of the above: what of a manifest is new. Keeps copies, and nothing of the manifest
-  // itself.
+  // The second half of the above: returns the mask of the types whose entry in the manifest is new, and keeps
+  // copies of these entries; nothing of the manifest itself is kept.
   std::int64_t compareWithManifest(const PropertyList& manifest, std::uint32_t mask);
+  // False when the type's version in the manifest differs from the recorded one, or either is missing. Says
+  // in the log why. Throws std::bad_alloc.
   bool isUpToDate(const PropertyList& manifest, std::int32_t type);
-  // Has the type's database installed and tells what came of it.
+  // Has the type's database installed and sends the telephony daemon the outcome. Blocks until the download
+  // is done. Throws std::bad_alloc before the download begins.
   void updateDatabase(std::int32_t type);
 
  private:

@@ -10,7 +10,7 @@
 
 namespace brenvik {
 
-// A fresh connection to Brenvik in this program's name; null when there is none to be had.
+// A fresh connection to Brenvik in this program's name; null when none can be made.
 std::unique_ptr<TelephonyDaemonConnection> openBrenvik(TelephonyDaemon& daemon);
 
 // The text as the platform takes it; absent when it is not valid UTF-8.

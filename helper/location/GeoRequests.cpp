@@ -4,7 +4,9 @@
 
 #include <utility>
 
+#include "helper/location/BrenvikPush.h"
 #include "platform/log/Log.h"
+#include "platform/log/LogContext.h"
 
 namespace brenvik {
 namespace {
@@ -61,6 +63,162 @@ std::string GeoRequests::currentCountryCode() {
   if (auto code = geoService_.currentCountryCode()) return *std::move(code);
   logBsd(SyslogPriority::error, "Didn't get valid country code from GeoService.\n");
   return {};
+}
+
+// ---- civic information ----
+
+void GeoRequests::requestCivicInfoFromLatitudeLongitude(double latitude, double longitude) {
+  auto info = std::make_shared<CivicInfo>();
+  if (latitude == 0.0 && longitude == 0.0) {
+    // What a caller without a position sends. Nothing is submitted, so nothing is awaited.
+    postToMainQueue(&GeoRequests::pushCivicFallback);
+    return;
+  }
+  const auto ticket = geoService_.makeReverseGeocodeTicket({latitude, longitude}, IncludeEta::no,
+                                                           ShiftLocations::ifNeeded, nullptr);
+  awaitGeoResponse(&GeoRequests::pushCivicFallback);
+  ticket->submit(
+      [self = shared_from_this(), info = std::move(info), context = LogScope::current()](
+          const std::optional<MapItems>& items, const std::optional<GeoError>& error) {
+        const LogScope scope(context);
+        const std::lock_guard lock(self->running_);
+        if (!self->closed_.load()) self->handleMapItems(*info, items, error);
+      },
+      nullptr, geoCallbackQueue());
+}
+
+void GeoRequests::handleMapItems(CivicInfo& info, const std::optional<MapItems>& items,
+                                 const std::optional<GeoError>& error) {
+  if (!takeAwaitedResponse()) {
+    logBsd(SyslogPriority::error,
+           "_RequestCivicInfoFromLatitudeLongitude wasn't waiting for response from GEO");
+    return;
+  }
+  state_.noteEnding(error ? GeoRequestState::Ending::failed : GeoRequestState::Ending::answered);
+  takeFirstMapItem(info, items, error);
+  if (info.countryCode.empty()) info.countryCode = currentCountryCode();
+  sendCivicInfoToBrenvik(info);
+}
+
+// Fills `info` as far as the answer goes.
+void GeoRequests::takeFirstMapItem(CivicInfo& info, const std::optional<MapItems>& items,
+                                   const std::optional<GeoError>& error) {
+  // An error is told twice over: by its description, and by the line of an answer without items.
+  if (error) {
+    logBsd(SyslogPriority::error, "_RequestCivicInfoFromLatitudeLongitude error: (%s)",
+           error->description.c_str());
+  }
+  if (error || !items || items->empty()) {
+    logBsd(SyslogPriority::error, "_RequestCivicInfoFromLatitudeLongitude didn't get any mapItems\n");
+    return;
+  }
+  logBsd(SyslogPriority::notice, "_RequestCivicInfoFromLatitudeLongitude mapItems: (%lu)",
+         static_cast<unsigned long>(items->size()));
+  const std::optional<MapItem>& item = items->front();
+  if (!item || !item->valid) {
+    logBsd(SyslogPriority::error, "_RequestCivicInfoLatitudeLongitude NULL mapItem \n");
+    return;
+  }
+  if (!item->address || !item->address->structuredAddress) {
+    logBsd(SyslogPriority::error,
+           "_RequestCivicInfoLatitudeLongitude mapItem didn't get a structured address");
+    return;
+  }
+  const StructuredAddress& address = *item->address->structuredAddress;
+  if (address.countryCode) {
+    logBsd(SyslogPriority::notice, "_RequestCivicInfoFromLatitudeLongitude country code: %s",
+           address.countryCode->c_str());
+    info.countryCode = *address.countryCode;
+  }
+  if (address.administrativeArea) {
+    logBsd(SyslogPriority::notice, "_RequestCivicInfoFromLatitudeLongitude state: %s",
+           address.administrativeArea->c_str());
+    info.state = *address.administrativeArea;
+  }
+  if (address.locality) {
+    logBsd(SyslogPriority::notice, "_RequestCivicInfoFromLatitudeLongitude city: %s",
+           address.locality->c_str());
+    info.city = *address.locality;
+  }
+  if (address.postCode) {
+    logBsd(SyslogPriority::notice, "_RequestCivicInfoFromLatitudeLongitude postal code: %s",
+           address.postCode->c_str());
+    info.postalCode = *address.postCode;
+  }
+}
+
+void GeoRequests::pushCivicFallback() {
+  CivicInfo info;
+  info.countryCode = currentCountryCode();
+  pushOffMainQueue(
+      [self = shared_from_this(), info = std::move(info)] { self->sendCivicInfoToBrenvik(info); });
+}
+
+void GeoRequests::sendCivicInfoToBrenvik(const CivicInfo& info) {
+  const auto connection = openBrenvik(telephonyDaemon_);
+  if (connection == nullptr) {
+    logBsd(SyslogPriority::error, "sendCivicInfoToQV to Brenvik failed, could not open QVServerConnection");
+    return;
+  }
+  const TelephonyResult result = connection->setCivicInfoBasedOnCurrentLocation(
+      platformString(info.countryCode), platformString(info.state), platformString(info.city),
+      platformString(info.postalCode));
+  if (const std::int32_t code = errorCodeOf(result); code != 0) {
+    logBsd(SyslogPriority::notice, "sendCivicInfoToQV failed civic info to Brenvik due to error: %d", code);
+  } else {
+    logBsd(SyslogPriority::notice, "sendCivicInfoToQV sent civic info to Brenvik successfully");
+  }
+}
+
+// ---- the public address ----
+
+void GeoRequests::requestWanIpFromLocation() {
+  const auto ticket = geoService_.makeGeoIpTicket(std::nullopt);
+  awaitGeoResponse(&GeoRequests::pushWanIpFallback);
+  ticket->submit(
+      [self = shared_from_this(), context = LogScope::current()](const std::optional<GeoIpResult>& result,
+                                                                 const std::optional<GeoError>& error) {
+        const LogScope scope(context);
+        const std::lock_guard lock(self->running_);
+        if (!self->closed_.load()) self->handleGeoIpResult(result, error);
+      },
+      nullptr, nullptr, geoCallbackQueue());
+}
+
+void GeoRequests::handleGeoIpResult(const std::optional<GeoIpResult>& result,
+                                    const std::optional<GeoError>& error) {
+  if (!takeAwaitedResponse()) {
+    logUnified(LogLevel::standard, "_RequestWanIPFromLocation wasn't waiting for response from GEO");
+    return;
+  }
+  state_.noteEnding(error ? GeoRequestState::Ending::failed : GeoRequestState::Ending::answered);
+  if (error) {
+    logUnified(LogLevel::error, "_RequestWanIPFromLocation error: (%s)", error->description.c_str());
+    // Empty, but pushed: the telephony daemon learns that there is no address.
+    sendWanIpToBrenvik("");
+    return;
+  }
+  const std::string address = result ? result->ipAddress : std::string();
+  logUnified(LogLevel::standard, "_RequestWanIPFromLocation WAN IP: %s", address.c_str());
+  sendWanIpToBrenvik(address);
+}
+
+void GeoRequests::pushWanIpFallback() {
+  pushOffMainQueue([self = shared_from_this()] { self->sendWanIpToBrenvik(""); });
+}
+
+void GeoRequests::sendWanIpToBrenvik(const std::string& address) {
+  const auto connection = openBrenvik(telephonyDaemon_);
+  if (connection == nullptr) {
+    logUnified(LogLevel::error, "sendWanIPToQV to Brenvik failed, could not open QVServerConnection");
+    return;
+  }
+  const TelephonyResult result = connection->setLocalRoutableAddress(platformString(address));
+  if (const std::int32_t code = errorCodeOf(result); code != 0) {
+    logUnified(LogLevel::error, "sendWanIPToQV failed WAN IP to Brenvik due to error: %d", code);
+  } else {
+    logUnified(LogLevel::standard, "sendWanIPToQV sent WAN IP to Brenvik successfully");
+  }
 }
 
 }  // namespace brenvik

@@ -26,8 +26,8 @@ class GeoRequests : public std::enable_shared_from_this<GeoRequests> {
               GeoRequestState& state)
       : queues_(queues), geoService_(geoService), telephonyDaemon_(telephonyDaemon), state_(state) {}
 
-  // Has the work item of a request run on the GEO callback queue, unless closed by then: at once, whatever
-  // the main loop does next. Main loop.
+  // Queues the work item of a request on the GEO callback queue. It runs without waiting for the main loop,
+  // or not at all if close() comes first. Main loop.
   void dispatch(WorkQueue::Task workItem);
 
   // Waits for the task that runs on the GEO callback queue; none starts afterwards. Main loop.
@@ -49,7 +49,7 @@ class GeoRequests : public std::enable_shared_from_this<GeoRequests> {
     std::string postalCode;
   };
 
-  // Runs the task on the GEO callback queue, unless closed by then. Any thread.
+  // Runs the task on the GEO callback queue, unless close() comes first. Any thread.
   void postToGeoCallbackQueue(WorkQueue::Task task);
   std::shared_ptr<WorkQueue> geoCallbackQueue() { return state_.geoCallbackQueue(queues_); }
   // Reads the flag once and, when it was set, clears it once; returns what was read.

@@ -2,10 +2,10 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "helper/voicemail/VoicemailOperations.h"
 
-#include <exception>
 #include <optional>
 #include <string>
 
+#include "platform/base/Guarded.h"
 #include "platform/base/Utf8.h"
 
 namespace brenvik {
@@ -25,71 +25,64 @@ void writeToken(const std::optional<std::string>& token, char* field) {
   field[token->copy(field, token->size())] = '\0';
 }
 
-// The routines' own boundary: nothing is thrown past it. A text that there is no memory for could not be
-// converted.
-template <typename Work>
-KernelReturn guarded(Work work) noexcept {
-  try {
-    return work();
-  } catch (const std::exception&) {
-    return kern::failure;
-  }
-}
-
-// The status of a routine that takes a text, for which the store had memory or not.
-KernelReturn codeFor(bool hadMemory) noexcept { return hadMemory ? kern::success : kern::failure; }
-
 }  // namespace
 
 KernelReturn VoicemailOperations::setVoicemailToken(PortName, char* token) noexcept {
-  return guarded([&] {
+  return guarded(kern::failure, [&] {
     const std::optional<std::string> text = textOf(token);
     if (!text) return kern::failure;
-    return codeFor(store_.setToken(&*text));
+    store_.setToken(&*text);
+    return kern::success;
   });
 }
 
 KernelReturn VoicemailOperations::setVoicemailTokenForKey(PortName, char* key, char* token) noexcept {
-  return guarded([&] {
+  return guarded(kern::failure, [&] {
     const std::optional<std::string> keyText = textOf(key);
     const std::optional<std::string> tokenText = textOf(token);
     if (!keyText || !tokenText) return kern::failure;
-    return codeFor(store_.setTokenForKey(*keyText, *tokenText));
+    store_.setTokenForKey(*keyText, *tokenText);
+    return kern::success;
   });
 }
 
 KernelReturn VoicemailOperations::clearVoicemailToken(PortName) noexcept {
-  (void)store_.setToken(nullptr);  // the routine has one status; the store logs what it could not do
-  return kern::success;
+  // The routine has one status; the store logs what it could not do.
+  return guarded(kern::success, [&] {
+    store_.setToken(nullptr);
+    return kern::success;
+  });
 }
 
-KernelReturn VoicemailOperations::resetVoicemailStore(PortName) noexcept {
+KernelReturn VoicemailOperations::resetVoicemailStore(PortName port) noexcept {
   // Each step by itself: when the first one fails, the records go all the same.
-  (void)store_.setToken(nullptr);
-  (void)store_.removeAllRecords();
-  return kern::success;
+  (void)clearVoicemailToken(port);
+  return guarded(kern::success, [&] {
+    store_.removeAllRecords();
+    return kern::success;
+  });
 }
 
 KernelReturn VoicemailOperations::copyVoicemailTokenForKey(PortName, char* key, char* token) noexcept {
-  return guarded([&] {
+  return guarded(kern::failure, [&] {
     const std::optional<std::string> keyText = textOf(key);
     if (!keyText) return kern::failure;
-    std::optional<std::string> value;
-    if (!store_.readTokenForKey(*keyText, &value)) return kern::failure;
-    writeToken(value, token);
+    writeToken(store_.copyTokenForKey(*keyText), token);
     return kern::success;
   });
 }
 
 KernelReturn VoicemailOperations::copyVoicemailToken(PortName, char* token) noexcept {
-  std::optional<std::string> value;
-  (void)store_.readToken(&value);  // what cannot be read is absent, and the store logs it
-  writeToken(value, token);
-  return kern::success;
+  // What cannot be read is absent, and the store logs it.
+  token[0] = '\0';
+  return guarded(kern::success, [&] {
+    writeToken(store_.copyToken(), token);
+    return kern::success;
+  });
 }
 
 KernelReturn VoicemailOperations::isVoicemailServiceSubscribed(PortName, std::uint8_t* subscribed) noexcept {
-  return guarded([&] {
+  return guarded(kern::failure, [&] {
     std::call_once(lookedUp_, [this] { query_ = library_.lookUpSubscriptionQuery(); });
     *subscribed = query_ != nullptr && query_() ? 1 : 0;
     return kern::success;

@@ -12,7 +12,7 @@ namespace {
 
 constexpr std::string_view kFirstLine = "brenvik-status=1";
 constexpr std::size_t kLongestWord = 64;
-constexpr std::size_t kMostItems = 64;  // of a list
+constexpr std::size_t kMaxItems = 64;  // of a list
 // Longer than any machine runs, and short enough for a clock's arithmetic.
 constexpr std::uint64_t kLongestTime = std::uint64_t{1} << 53;
 
@@ -120,7 +120,7 @@ bool read(std::string_view text, StatusReport::Worker* value) {
 
 template <class Item>
 bool readItem(std::string_view text, std::vector<Item>* list) {
-  return list->size() < kMostItems && read(text, &list->emplace_back());
+  return list->size() < kMaxItems && read(text, &list->emplace_back());
 }
 
 // One line into the report. Lists may have several; any other key stands once.
@@ -204,7 +204,7 @@ std::optional<StatusReport> readStatus(std::string_view text) {
   return report;
 }
 
-std::vector<std::string> whatHolds(const StatusReport& report) {
+std::vector<std::string> busyReasons(const StatusReport& report) {
   std::vector<std::string> words;
   if (report.clients != 0) {
     words.push_back(std::to_string(report.clients) + (report.clients == 1 ? " client" : " clients"));

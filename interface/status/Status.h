@@ -27,7 +27,7 @@ struct StatusEvent {
 };
 
 struct StatusReport {
-  // Reasons for busy tokens, as they are sent; see whatHolds() for people's words.
+  // Reasons for busy tokens, as they are sent; see busyReasons() for people's words.
   static constexpr const char* kDatabaseCheck = "database-check";
   static constexpr const char* kHeartbeat = "heartbeat";
 
@@ -83,6 +83,6 @@ std::optional<StatusReport> readStatus(std::string_view text);
 
 // What keeps the helper from leaving, in words: "2 clients", "a database check", "the heartbeat". Empty:
 // nothing does.
-std::vector<std::string> whatHolds(const StatusReport& report);
+std::vector<std::string> busyReasons(const StatusReport& report);
 
 }  // namespace brenvik

@@ -118,16 +118,17 @@ TEST(StatusTest, WrongValuesAreRefused) {
 
 TEST(StatusTest, WhatHoldsTheHelperIsSaidInWords) {
   StatusReport report;
-  EXPECT_TRUE(whatHolds(report).empty());
+  EXPECT_TRUE(busyReasons(report).empty());
   report.isKeptByBaseband = true;
-  EXPECT_EQ(whatHolds(report), (std::vector<std::string>{"the hosted baseband server"}));
+  EXPECT_EQ(busyReasons(report), (std::vector<std::string>{"the hosted baseband server"}));
   report.clients = 1;
-  EXPECT_EQ(whatHolds(report), (std::vector<std::string>{"1 client"}));
+  EXPECT_EQ(busyReasons(report), (std::vector<std::string>{"1 client"}));
   report = fullReport();
-  EXPECT_EQ(whatHolds(report), (std::vector<std::string>{"2 clients", "a database check", "the heartbeat"}));
+  EXPECT_EQ(busyReasons(report),
+            (std::vector<std::string>{"2 clients", "a database check", "the heartbeat"}));
   report.isHeartbeatOn = false;
   report.busy = {{"heartbeat", 1}, {"something", 1}};
-  EXPECT_EQ(whatHolds(report),
+  EXPECT_EQ(busyReasons(report),
             (std::vector<std::string>{"2 clients", "a heartbeat that was switched on more than once",
                                       "something"}));
 }

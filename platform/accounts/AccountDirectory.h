@@ -15,7 +15,7 @@ struct AccountIds {
   bool operator==(const AccountIds&) const = default;
 };
 
-// The accounts the system knows. Any thread; a call may wait for whatever the system keeps its accounts in.
+// The accounts the system knows. Any thread; a call may wait for the service that keeps the accounts.
 // Throws std::bad_alloc when this process lacks the memory or the descriptors to find out: that is no answer.
 class AccountDirectory {
  public:

@@ -6,8 +6,8 @@
 
 namespace brenvik {
 
-// Since the system started, the time it slept included, as the run loop's timers count. Nobody sets this
-// clock. Any thread; no system call.
+// The time since the system started, sleep included: the clock of the run loop's timers. It is never set. Any
+// thread; no system call.
 std::chrono::nanoseconds timeSinceBoot() noexcept;
 
 }  // namespace brenvik

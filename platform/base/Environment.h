@@ -6,10 +6,10 @@
 
 namespace brenvik {
 
-// Takes every variable out of the process's environment but those of these names, so that no library finds a
-// proxy, a certificate folder, a key log, a language or a time zone there, and no child is given one. What
-// the dynamic loader has read before the program began (LD_PRELOAD, LD_LIBRARY_PATH) has had its effect.
-// Before other threads start; allocates nothing.
+// Removes every variable from the process's environment except those named, so that no library or child finds
+// a proxy, a certificate folder, a key log, a language or a time zone there. Variables that the dynamic
+// loader read before the program began (LD_PRELOAD, LD_LIBRARY_PATH) have had their effect. Call it before
+// other threads start; allocates nothing.
 void clearEnvironmentExcept(std::initializer_list<const char*> names) noexcept;
 
 }  // namespace brenvik

@@ -11,8 +11,8 @@
 
 namespace brenvik {
 
-// What /proc/PID/stat (proc(5)) says of which process it is and whether it still runs. With the process id,
-// the start time names one process for as long as the system is up.
+// A process's identity and state, from /proc/PID/stat (proc(5)). The process id and the start time together
+// name one process for as long as the system is up.
 struct ProcessFacts {
   char state = '?';             // field 3
   pid_t session = 0;            // field 6
@@ -26,10 +26,10 @@ std::optional<ProcessFacts> parseProcessStat(std::string_view text) noexcept;
 std::optional<ProcessFacts> processFacts(pid_t pid) noexcept;
 std::optional<std::uint32_t> processStartTime(pid_t pid) noexcept;
 
-// Of which file this process runs. Any thread.
+// The program file that this process runs. Any thread.
 struct ProgramFacts {
-  std::string path;         // where it stood when it was started; empty: not known
-  bool isReplaced = false;  // another file stands there now, or none
+  std::string path;         // its path when the process started; empty: not known
+  bool isReplaced = false;  // the path is another file now, or none
 };
 ProgramFacts programFacts();
 // The same for a link like /proc/self/exe.

@@ -26,10 +26,9 @@ class ContactsChannelManager {
 class ContactsService {
  public:
   virtual ~ContactsService() = default;
-  // A new manager, or null when the contacts cannot be reached; when *lackedMemory, if given, becomes true,
-  // they perhaps can, and there was no memory for it.
-  virtual std::unique_ptr<ContactsChannelManager> makeChannelManager(
-      bool* lackedMemory = nullptr) noexcept = 0;
+  // A new manager, or null when the contacts cannot be reached. Throws std::bad_alloc when memory did not
+  // suffice to find out.
+  virtual std::unique_ptr<ContactsChannelManager> makeChannelManager() = 0;
 };
 
 }  // namespace brenvik

@@ -38,7 +38,7 @@ enum class Intermediates { mustExist, create };
 
 enum class Durability {
   eventual,  // the system writes it to the disk when it sees fit
-  onReturn   // a success is told when everything is on the disk, the names included
+  onReturn   // success means that everything is on the disk, the names included
 };
 
 struct DirectoryAttributes {

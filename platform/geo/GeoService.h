@@ -13,8 +13,8 @@
 namespace brenvik {
 
 struct AuditToken;
-class GeoTraits;           // a caller's wishes for an answer; nobody here has any
-class GeoNetworkActivity;  // a caller's activity that traffic is accounted to; nobody here has one
+class GeoTraits;           // a caller's wishes for an answer; not used here
+class GeoNetworkActivity;  // a caller's activity that traffic is accounted to; not used here
 
 // Degrees, north and east positive. Any numbers may stand here; the service judges them.
 struct Coordinate {
@@ -76,7 +76,7 @@ class GeoIpTicket {
                       const std::shared_ptr<WorkQueue>& handlerQueue) = 0;
 };
 
-// Looks things up for whoever asks. Any thread. It must outlive its tickets; answers that are under way when
+// Makes the tickets of look-ups. Any thread. It must outlive its tickets; answers that are under way when
 // it is destroyed are dropped.
 class GeoTickets {
  public:

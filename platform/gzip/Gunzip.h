@@ -15,7 +15,7 @@ enum class GunzipResult {
   tooLarge,   // more output than allowed
   refused,    // the output could not be written, or its receiver said no
   outOfMemory,
-  unavailable,  // the decompressor cannot be had, or did not end in time
+  unavailable,  // the decompressor cannot be reached, or did not end in time
 };
 
 // A gzip file in memory.

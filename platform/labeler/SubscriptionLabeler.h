@@ -23,19 +23,17 @@ inline constexpr std::string_view data = "com.norvale.subscription-label.data";
 // and an array of language identifiers (BCP 47, the preferred one first) and give an array of texts, or no
 // value when they cannot. Elements that are not texts are passed over in either array: the result has one
 // element for each text among the labels, in their order. No languages, or none that is known: English.
-// The same arguments give the same result. Any thread.
+// The same arguments give the same result. Any thread. Both throw std::bad_alloc.
 class SubscriptionLabeler {
  public:
   virtual ~SubscriptionLabeler() = default;
 
   // Short forms of the labels (identifiers above, or a user's own texts): one to three grapheme clusters
   // each, no two of one result alike. No value when there are more labels than such forms.
-  virtual PropertyList localizedBadgeLabels(const PropertyList& labels,
-                                            const PropertyList& languages) noexcept = 0;
+  virtual PropertyList localizedBadgeLabels(const PropertyList& labels, const PropertyList& languages) = 0;
 
   // The labels' names. A text that is no identifier is its own name. `languages` may be no value.
-  virtual PropertyList localizedLabels(const PropertyList& labels,
-                                       const PropertyList& languages) noexcept = 0;
+  virtual PropertyList localizedLabels(const PropertyList& labels, const PropertyList& languages) = 0;
 };
 
 }  // namespace brenvik

@@ -21,8 +21,8 @@ struct LogPlace {
       function;  // for a sink its name alone; in a call of logUnifiedAt the signature as the compiler has it
 };
 
-// The name in such a signature, without scope and arguments; of a lambda the name of the function that it is
-// in.
+// The function's name in such a signature, without scope and arguments. For a lambda it is the name of the
+// enclosing function.
 std::string_view functionNameIn(std::string_view signature) noexcept;
 
 // The journal's name for a log text, 128 bits: made of the text itself as it stands in the source (FNV-1a),
@@ -33,7 +33,8 @@ struct MessageId {
   bool operator==(const MessageId&) const = default;
 };
 
-// Of a format without its trailing newline. A format of "%s" alone has no text of its own: the line's counts.
+// The id of a format, its trailing newline left out. A format of "%s" alone has no text of its own, so the id
+// is made of the line.
 MessageId messageIdOf(std::string_view format, std::string_view line) noexcept;
 
 // Where finished lines go. Implementations are called from any thread and never throw, block on a reader or

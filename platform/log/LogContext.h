@@ -94,7 +94,7 @@ class LogFields {
   LogFields(const LogFields&) = delete;
   LogFields& operator=(const LogFields&) = delete;
 
-  static constexpr std::size_t kMost = 5;
+  static constexpr std::size_t kMaxFields = 5;
   std::span<const Field> all() const noexcept { return {fields_.data(), count_}; }
 
  private:
@@ -104,7 +104,7 @@ class LogFields {
   const LogContext context_;
   std::array<char, 12> pid_;
   std::array<char, 12> uid_;
-  std::array<Field, kMost> fields_;
+  std::array<Field, kMaxFields> fields_;
   std::size_t count_ = 0;
 };
 

@@ -15,7 +15,7 @@ namespace brenvik {
 namespace {
 
 // The helper looks at the first, and no source here has more.
-constexpr std::uint32_t kMostItems = 16;
+constexpr std::uint32_t kMaxItems = 16;
 
 bool isText(std::string_view text) noexcept {
   return !text.empty() && text.find('\0') == std::string_view::npos && isValidUtf8(text);
@@ -116,7 +116,7 @@ std::vector<std::byte> encode(const GeoOutcome<MapItems>& outcome) {
   FieldWriter to;
   write(to, outcome.error);
   if (!outcome.error) {
-    const auto count = outcome.answer ? std::min<std::size_t>(outcome.answer->size(), kMostItems) : 0;
+    const auto count = outcome.answer ? std::min<std::size_t>(outcome.answer->size(), kMaxItems) : 0;
     to.u32(static_cast<std::uint32_t>(count));
     for (std::size_t i = 0; i < count; ++i) write(to, (*outcome.answer)[i]);
   }
@@ -129,7 +129,7 @@ std::optional<GeoOutcome<MapItems>> decodeMapItems(std::span<const std::byte> pa
   outcome.error = readError(from);
   if (!outcome.error && !from.hasFailed()) {
     const auto count = from.u32();
-    if (count > kMostItems || payload.size() > kLongestAddress) from.fail();
+    if (count > kMaxItems || payload.size() > kLongestAddress) from.fail();
     outcome.answer.emplace();
     for (std::uint32_t i = 0; i < count && !from.hasFailed(); ++i) outcome.answer->push_back(readItem(from));
   }

@@ -14,7 +14,7 @@ using namespace brenvik;
 
 namespace {
 
-constexpr std::uint64_t kLargest = 10'000;
+constexpr std::uint64_t kMaxSize = 10'000;
 
 void require(bool holds) {
   if (!holds) std::abort();
@@ -42,16 +42,16 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   const auto payload = std::as_bytes(std::span(data, size)).subspan(1);
   switch (data[0] % 6) {
     case 0:
-      if (const auto answer = decodeWebAnswer(payload, kLargest)) {
-        require(answer->bodySize <= kLargest && answer->statusCode >= 0 && answer->statusCode < 1000);
+      if (const auto answer = decodeWebAnswer(payload, kMaxSize)) {
+        require(answer->bodySize <= kMaxSize && answer->statusCode >= 0 && answer->statusCode < 1000);
         require(answer->errorKind == WebErrorKind::none || answer->bodySize == 0);
-        const auto again = decodeWebAnswer(encode(*answer), kLargest);
+        const auto again = decodeWebAnswer(encode(*answer), kMaxSize);
         require(again && again->headers == answer->headers && again->bodySize == answer->bodySize);
       }
       break;
     case 1:
-      if (const auto outcome = decodeGunzipOutcome(payload, {100, 1000, kLargest}))
-        require(outcome->size <= kLargest &&
+      if (const auto outcome = decodeGunzipOutcome(payload, {100, 1000, kMaxSize}))
+        require(outcome->size <= kMaxSize &&
                 (outcome->result == GunzipResult::refused) == (outcome->writeError != 0));
       break;
     case 2:

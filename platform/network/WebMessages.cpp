@@ -61,8 +61,8 @@ std::optional<WebQuestion> decodeWebQuestion(std::span<const std::byte> payload)
   question.largestBody = from.u64();
   question.headers = readHeaders(from);
   // Longer than a day is no limit that anybody means, and would overflow on its way to a deadline.
-  constexpr std::int64_t kLongest = std::chrono::milliseconds(std::chrono::hours(24)).count();
-  if (!from.whole() || limit < 0 || limit > kLongest || question.largestBody > kLargestWebBody)
+  constexpr std::int64_t kMaxTimeLimit = std::chrono::milliseconds(std::chrono::hours(24)).count();
+  if (!from.whole() || limit < 0 || limit > kMaxTimeLimit || question.largestBody > kLargestWebBody)
     return std::nullopt;
   question.timeLimit = std::chrono::milliseconds(limit);
   return question;

@@ -185,7 +185,7 @@ bool Reader::beginContainer(std::size_t object, bool isDictionary, const unsigne
   }
   // Every reference is at least eight bytes of the document as XML.
   references_ += references;
-  if (frames_.size() == kDeepestPropertyList || references_ > kLargestXmlForm / 8) return false;
+  if (frames_.size() == kMaxPropertyListDepth || references_ > kLargestXmlForm / 8) return false;
   const std::size_t room = isDictionary ? dictionaryBytes(count) : count * sizeof(Node);
   auto* const children = static_cast<Node*>(document_->allocate(room));
   node.tag = Tag::pending;
@@ -315,7 +315,7 @@ bool Reader::walk() {
         isFull ? done_[slot.done] : Measure{largestExtent(node), std::size_t{node.isContainer()}};
     frame.measure.extent.addChild(child.extent);
     frame.measure.height = std::max(frame.measure.height, child.height + 1);
-    if (frames_.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
+    if (frames_.size() - 1 + frame.measure.height > kMaxPropertyListDepth) return false;
     if (!frame.isDictionary) {
       frame.children[frame.next] = node;
     } else {

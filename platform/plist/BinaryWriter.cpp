@@ -135,7 +135,7 @@ std::uint32_t Writer::add(const Node& node, std::uint32_t hash) {
 bool Writer::enter(const Node& container) {
   const std::size_t count = container.childCount();
   // Every reference is at least eight bytes of the document as XML.
-  if (frames_.size() == kDeepestPropertyList || references_.size() + count > kLargestXmlForm / 8)
+  if (frames_.size() == kMaxPropertyListDepth || references_.size() + count > kLargestXmlForm / 8)
     return false;
   const auto object = static_cast<std::uint32_t>(objects_.size() - 1);
   objects_[object].references = static_cast<std::uint32_t>(references_.size());
@@ -183,7 +183,7 @@ bool Writer::number(const Node& root) {
                                    : Measure{largestExtent(child), std::size_t{child.isContainer()}};
     frame.measure.extent.addChild(measure.extent);
     frame.measure.height = std::max(frame.measure.height, measure.height + 1);
-    if (frames_.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
+    if (frames_.size() - 1 + frame.measure.height > kMaxPropertyListDepth) return false;
     // All the keys stand before all the values.
     std::size_t slot = frame.next;
     if (inDictionary) slot = frame.next / 2 + (frame.next % 2 == 0 ? 0 : frame.count / 2);

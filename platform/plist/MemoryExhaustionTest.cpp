@@ -1,55 +1,17 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 //
-// Every allocation of every operation fails once, alone and with all that follow it. The C library's
-// functions are replaced for this program; sanitizers have replaced them already, so there these tests are
-// skipped.
+// Every allocation of every operation fails once, alone and with all that follow it. Not with
+// a sanitizer, which has the C library's functions to itself.
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <functional>
+#include <optional>
 
+#include "platform/base/fakes/FailingMalloc.h"
 #include "platform/plist/PropertyListCodec.h"
 
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-#define BRENVIK_MALLOC_IS_TAKEN
-#elif defined(__has_feature)
-#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
-#define BRENVIK_MALLOC_IS_TAKEN
-#endif
-#endif
-
 #ifndef BRENVIK_MALLOC_IS_TAKEN
-
-namespace {
-
-constinit thread_local bool armed = false;
-constinit thread_local bool allFollowing = false;
-constinit thread_local long untilFailure = 0;
-constinit thread_local long failures = 0;
-
-bool failsNow() {
-  if (!armed || untilFailure-- > 0) return false;
-  if (untilFailure != -1 && !allFollowing) return false;
-  ++failures;
-  return true;
-}
-
-}  // namespace
-
-extern "C" {
-// The names under which the C library keeps its own functions reachable.
-// NOLINTBEGIN(bugprone-reserved-identifier)
-void* __libc_malloc(std::size_t size);
-void* __libc_calloc(std::size_t count, std::size_t size);
-void* __libc_realloc(void* memory, std::size_t size);
-// NOLINTEND(bugprone-reserved-identifier)
-void* malloc(std::size_t size) { return failsNow() ? nullptr : __libc_malloc(size); }
-void* calloc(std::size_t count, std::size_t size) {
-  return failsNow() ? nullptr : __libc_calloc(count, size);
-}
-void* realloc(void* memory, std::size_t size) { return failsNow() ? nullptr : __libc_realloc(memory, size); }
-}
 
 namespace brenvik {
 namespace {
@@ -58,16 +20,13 @@ namespace {
 void failEveryAllocation(const std::function<bool()>& operation, const std::function<bool()>& check) {
   ASSERT_TRUE(operation());
   ASSERT_TRUE(check());
-  for (const bool following : {false, true}) {
+  for (const auto howMany : {FailingMalloc::HowMany::one, FailingMalloc::HowMany::all}) {
     long failed = 0;
     while (true) {
-      armed = true;
-      allFollowing = following;
-      untilFailure = failed;
-      failures = 0;
+      std::optional<FailingMalloc> failing(std::in_place, failed, howMany);
       const bool done = operation();
-      armed = false;
-      if (failures == 0) break;
+      failing.reset();
+      if (FailingMalloc::failures() == 0) break;
       if (done) {
         ASSERT_TRUE(check()) << "allocation " << failed;
       }
@@ -152,10 +111,11 @@ TEST(MemoryExhaustionTest, BuildingGivesTheValueOrNone) {
   std::vector<std::pair<std::string, PropertyList>> entries;
   failEveryAllocation(
       [&] {
-        const bool wasArmed = std::exchange(armed, false);
-        elements = {part, whole};
-        entries = {{"part", part}, {"whole", whole}};
-        armed = wasArmed;
+        {
+          const FailingMalloc::Pause pause;
+          elements = {part, whole};
+          entries = {{"part", part}, {"whole", whole}};
+        }
         const PropertyList array = PropertyList::array(elements);
         made = PropertyList::dictionary(entries);
         return array && made;

@@ -638,7 +638,7 @@ bool Reader::scalar(Element element) {
 
 bool Reader::beginContainer(bool isDictionary) {
   const Form form = tagEnd();
-  if (form == Form::wrong || frames_.size() == kDeepestPropertyList) return false;
+  if (form == Form::wrong || frames_.size() == kMaxPropertyListDepth) return false;
   frames_.push_back({nodes_.size(), isDictionary});
   deepest_ = std::max(deepest_, frames_.size());
   return form == Form::open || endContainer();

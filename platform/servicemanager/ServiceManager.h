@@ -6,15 +6,16 @@
 
 namespace brenvik {
 
-// Whoever has started this process and shows it to people.
+// The service manager that started this process and shows its state to people.
 class ServiceManager {
  public:
   virtual ~ServiceManager() = default;
 
-  // False: nobody listens, and showing is for nothing.
+  // True if somebody listens. Otherwise show() has no effect.
   virtual bool listens() const noexcept = 0;
   // Shows the line from now on. Does not wait; a line that cannot be sent is lost. Any thread.
-  virtual void show(const std::string& line) noexcept = 0;
+  // Throws std::bad_alloc.
+  virtual void show(const std::string& line) = 0;
 };
 
 }  // namespace brenvik

@@ -4,9 +4,9 @@
 
 #include <dlfcn.h>
 
+#include <cerrno>
 #include <mutex>
 
-#include "platform/base/Library.h"
 #include "platform/sqlite/HeldFolder.h"
 
 namespace brenvik {
@@ -20,9 +20,11 @@ bool look(void* library, const char* name, Function* function) noexcept {
   return *function != nullptr;
 }
 
-bool limit(const SqliteFunctions& functions) noexcept {
-  (void)functions.hard_heap_limit64(kMostSqliteMemory);
+bool limit(const SqliteFunctions& functions, bool* lackedMemory) noexcept {
+  (void)functions.hard_heap_limit64(kMaxSqliteMemory);
   sqlite3_vfs* const files = functions.vfs_find(nullptr);
+  // There is always one, unless the library could not start.
+  *lackedMemory = files == nullptr;
   return files != nullptr && files->iVersion >= 3 &&
          understandHeldFolders(files, [](void* vfs, const char* name, void (*function)()) {
            auto* const of = static_cast<sqlite3_vfs*>(vfs);
@@ -31,15 +33,18 @@ bool limit(const SqliteFunctions& functions) noexcept {
 }
 
 bool load(SqliteFunctions* functions, bool* lackedMemory) noexcept {
+  errno = 0;
   void* const library = ::dlopen(kLibrary, RTLD_NOW | RTLD_LOCAL);
   if (library == nullptr) {
-    *lackedMemory = tellsLackOfMemory(::dlerror());
+    // A missing library leaves ENOENT behind. The loader gives up at the first allocation that fails, and its
+    // text does not always speak of memory.
+    *lackedMemory = errno == ENOMEM;
     return false;
   }
 #define BRENVIK_SQLITE_LOOK(name) &&look(library, "sqlite3_" #name, &functions->name)
   const bool isWhole = true BRENVIK_SQLITE_FUNCTIONS(BRENVIK_SQLITE_LOOK);
 #undef BRENVIK_SQLITE_LOOK
-  return isWhole && limit(*functions);
+  return isWhole && limit(*functions, lackedMemory);
 }
 
 }  // namespace

@@ -31,15 +31,15 @@ struct SqliteFunctions {
 
 // Bytes that SQLite may have at once, for all connections of the process: ten times what a remap of 100,000
 // contacts takes. A statement that needs more fails with SQLITE_NOMEM.
-inline constexpr std::int64_t kMostSqliteMemory = std::int64_t{32} << 20;
+inline constexpr std::int64_t kMaxSqliteMemory = std::int64_t{32} << 20;
 
-// The functions, all of them, for the life of the process; null where there is no usable library (asked
-// again, it looks again), or where *lackedMemory, if given, says so, none could be loaded now. Any thread.
-// The library has kMostSqliteMemory, and opens files without waiting for whoever is at the other end of a
-// pipe.
+// Loads the library if it is not loaded yet, and returns its functions, valid for the life of the process.
+// Null when there is no usable library, or when memory did not suffice to load it: *lackedMemory, if given,
+// tells the two apart. The next call tries again. Any thread. The library may use kMaxSqliteMemory, and opens
+// a pipe without waiting for its other end.
 const SqliteFunctions* sqlite(bool* lackedMemory = nullptr) noexcept;
 
-// Whether a result of SQLite, plain or extended, is for want of memory.
+// True if a result code of SQLite, plain or extended, means that memory ran out.
 constexpr bool isLackOfMemory(int code) noexcept {
   return (code & 0xFF) == SQLITE_NOMEM || code == SQLITE_IOERR_NOMEM;
 }

@@ -132,7 +132,7 @@ TEST_F(ForeignDatabaseTest, WhatIsTakenFromASchemaIsNotTrustedAndLongTextsAreNot
 
 TEST(SqliteTest, TheMemoryOfAllDatabasesIsLimited) {
   ASSERT_NE(sqlite(), nullptr);
-  EXPECT_EQ(sqlite()->hard_heap_limit64(-1), kMostSqliteMemory);
+  EXPECT_EQ(sqlite()->hard_heap_limit64(-1), kMaxSqliteMemory);
 }
 
 }  // namespace

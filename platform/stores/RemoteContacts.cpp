@@ -106,25 +106,20 @@ class RemoteManager final : public ContactsChannelManager {
 
 }  // namespace
 
-std::unique_ptr<ContactsChannelManager> RemoteContacts::makeChannelManager(bool* lackedMemory) noexcept {
-  if (lackedMemory != nullptr) *lackedMemory = false;
-  try {
-    auto manager = std::make_unique<RemoteManager>(worker_, Clock::now() + patience_);
-    StoreFolder::Opened folder;
-    const StoreFolder::State state = folder_.open(StoreFolder::IfMissing::fail, &folder);
-    if (state == StoreFolder::State::outOfMemory) throw std::bad_alloc();
-    if (state != StoreFolder::State::open) return nullptr;
-    (void)folder_.prepare(folder);
-    switch (manager->open(folder.descriptor)) {
-      case stores::ContactsOutcome::open:
-        return manager;
-      case stores::ContactsOutcome::noDatabase:
-        return nullptr;
-      case stores::ContactsOutcome::outOfMemory:
-        throw std::bad_alloc();
-    }
-  } catch (const std::bad_alloc&) {
-    if (lackedMemory != nullptr) *lackedMemory = true;
+std::unique_ptr<ContactsChannelManager> RemoteContacts::makeChannelManager() {
+  auto manager = std::make_unique<RemoteManager>(worker_, Clock::now() + patience_);
+  StoreFolder::Opened folder;
+  const StoreFolder::State state = folder_.open(StoreFolder::IfMissing::fail, &folder);
+  if (state == StoreFolder::State::outOfMemory) throw std::bad_alloc();
+  if (state != StoreFolder::State::open) return nullptr;
+  (void)folder_.prepare(folder);
+  switch (manager->open(folder.descriptor)) {
+    case stores::ContactsOutcome::open:
+      return manager;
+    case stores::ContactsOutcome::noDatabase:
+      return nullptr;
+    case stores::ContactsOutcome::outOfMemory:
+      throw std::bad_alloc();
   }
   return nullptr;
 }

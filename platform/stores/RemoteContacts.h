@@ -22,9 +22,9 @@ class RemoteContacts final : public ContactsService {
   RemoteContacts(Worker& worker, StoreFolder& folder, std::chrono::milliseconds patience = kPatience)
       : worker_(worker), folder_(folder), patience_(patience) {}
 
-  // With a worker that cannot be had there is a manager, whose remap fails and says why: null would mean that
-  // there are no contacts.
-  std::unique_ptr<ContactsChannelManager> makeChannelManager(bool* lackedMemory = nullptr) noexcept override;
+  // If the worker cannot be reached there is still a manager; its remap fails and says why. Null would mean
+  // that there are no contacts.
+  std::unique_ptr<ContactsChannelManager> makeChannelManager() override;
 
  private:
   Worker& worker_;

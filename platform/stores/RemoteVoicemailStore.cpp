@@ -15,7 +15,6 @@ using stores::Operation;
 using stores::VoicemailAnswer;
 using stores::VoicemailOutcome;
 using stores::VoicemailRequest;
-using Clock = std::chrono::steady_clock;
 
 // Sends the request, with the folder when the worker does not have it yet. A worker that has gone since the
 // last request is replaced once: it has seen nothing of this one.
@@ -70,83 +69,88 @@ RemoteVoicemailStore::Result RemoteVoicemailStore::exchange(VoicemailRequest* re
   }
   bool isRepeated = false;
   for (;;) {
-    request->serial = ++serial_;
-    const WorkerResult sent = send(*request, folder);
-    if (sent != WorkerResult::done)
-      return sent == WorkerResult::outOfMemory ? Result::outOfMemory : Result::failed;
-    WorkerMessage message;
-    const WorkerResult received = channel_.receive(&message, deadline);
-    if (received == WorkerResult::outOfMemory) {
-      channel_.close();
-      return Result::outOfMemory;
-    }
-    auto decoded = received == WorkerResult::done ? stores::decodeVoicemailAnswer(message) : std::nullopt;
-    if (!decoded || decoded->serial != request->serial) {
-      channel_.discard(&message);
-      const bool hasDied = received == WorkerResult::closed;
-      // Of an answer that comes later nobody would know what it answers.
-      worker_.giveUp(&channel_);
-      // Whatever it was ended by; each operation is the same when it is done twice.
-      if (hasDied && !std::exchange(isRepeated, true)) continue;
-      return Result::failed;
-    }
-    if (decoded->outcome == VoicemailOutcome::notAllowed) {
-      if (request->insists) return Result::failed;
-      (void)folder_.prepare(folder);  // somebody of root's has put a file there since
-      request->insists = true;
-      continue;
-    }
-    *answer = std::move(*decoded);
-    return answer->outcome == VoicemailOutcome::outOfMemory ? Result::outOfMemory : Result::done;
+    const Received received = ask(request, folder, deadline, answer);
+    // Whatever the worker was ended by; each operation is the same when it is done twice.
+    if (received == Received::workerDied && !std::exchange(isRepeated, true)) continue;
+    if (received == Received::outOfMemory) return Result::outOfMemory;
+    if (received != Received::answer) return Result::failed;
+    if (answer->outcome == VoicemailOutcome::outOfMemory) return Result::outOfMemory;
+    if (answer->outcome != VoicemailOutcome::notAllowed) return Result::done;
+    if (std::exchange(request->insists, true)) return Result::failed;
+    (void)folder_.prepare(folder);  // somebody of root's has put a file there since
   }
 }
 
-bool RemoteVoicemailStore::perform(Operation operation, const std::string* key, const std::string* token,
-                                   std::optional<std::string>* found) noexcept {
-  if (found != nullptr) found->reset();
+// Asks once and waits for the answer.
+RemoteVoicemailStore::Received RemoteVoicemailStore::ask(VoicemailRequest* request,
+                                                         const StoreFolder::Opened& folder,
+                                                         Clock::time_point deadline,
+                                                         VoicemailAnswer* answer) {
+  request->serial = ++serial_;
+  const WorkerResult sent = send(*request, folder);
+  if (sent != WorkerResult::done) {
+    return sent == WorkerResult::outOfMemory ? Received::outOfMemory : Received::nothing;
+  }
+  WorkerMessage message;
+  const WorkerResult received = channel_.receive(&message, deadline);
+  if (received == WorkerResult::outOfMemory) {
+    channel_.close();
+    return Received::outOfMemory;
+  }
+  auto decoded = received == WorkerResult::done ? stores::decodeVoicemailAnswer(message) : std::nullopt;
+  if (decoded && decoded->serial == request->serial) {
+    *answer = std::move(*decoded);
+    return Received::answer;
+  }
+  channel_.discard(&message);
+  // Nobody would know what an answer that comes later answers.
+  worker_.giveUp(&channel_);
+  return received == WorkerResult::closed ? Received::workerDied : Received::nothing;
+}
+
+std::optional<std::string> RemoteVoicemailStore::perform(Operation operation, const std::string* key,
+                                                         const std::string* token) {
   Result result = Result::outOfMemory;
-  bool isToldByWorker = false;
+  VoicemailAnswer answer;
   try {
     VoicemailRequest request;
     request.operation = operation;
     if (key != nullptr) request.key = *key;
     if (token != nullptr) request.token = *token;
-    VoicemailAnswer answer;
     result = exchange(&request, &answer);
-    isToldByWorker = result == Result::outOfMemory && answer.outcome == VoicemailOutcome::outOfMemory;
-    if (found != nullptr) *found = std::move(answer.token);
   } catch (const std::bad_alloc&) {
     // What the worker says now answers nothing any more. The lack is this process's own.
     channel_.close();
+    answer = {};
   }
+  const bool isToldByWorker =
+      result == Result::outOfMemory && answer.outcome == VoicemailOutcome::outOfMemory;
   if (result != Result::done && !isToldByWorker) {
     if (stores::writes(operation))
       logUnified(LogLevel::error, "The voicemail store could not be written");
     else
       logUnified(LogLevel::error, "The voicemail store could not be read");
   }
-  return result != Result::outOfMemory;
+  if (result == Result::outOfMemory) throw std::bad_alloc();
+  return result == Result::done ? std::move(answer.token) : std::nullopt;
 }
 
-bool RemoteVoicemailStore::setToken(const std::string* token) noexcept {
-  return perform(token == nullptr ? Operation::clearToken : Operation::setToken, nullptr, token, nullptr);
+void RemoteVoicemailStore::setToken(const std::string* token) {
+  perform(token == nullptr ? Operation::clearToken : Operation::setToken, nullptr, token);
 }
 
-bool RemoteVoicemailStore::setTokenForKey(const std::string& key, const std::string& token) noexcept {
-  return perform(Operation::setTokenForKey, &key, &token, nullptr);
+void RemoteVoicemailStore::setTokenForKey(const std::string& key, const std::string& token) {
+  perform(Operation::setTokenForKey, &key, &token);
 }
 
-bool RemoteVoicemailStore::removeAllRecords() noexcept {
-  return perform(Operation::removeAllRecords, nullptr, nullptr, nullptr);
+void RemoteVoicemailStore::removeAllRecords() { perform(Operation::removeAllRecords, nullptr, nullptr); }
+
+std::optional<std::string> RemoteVoicemailStore::copyToken() {
+  return perform(Operation::readToken, nullptr, nullptr);
 }
 
-bool RemoteVoicemailStore::readToken(std::optional<std::string>* token) noexcept {
-  return perform(Operation::readToken, nullptr, nullptr, token);
-}
-
-bool RemoteVoicemailStore::readTokenForKey(const std::string& key,
-                                           std::optional<std::string>* token) noexcept {
-  return perform(Operation::readTokenForKey, &key, nullptr, token);
+std::optional<std::string> RemoteVoicemailStore::copyTokenForKey(const std::string& key) {
+  return perform(Operation::readTokenForKey, &key, nullptr);
 }
 
 }  // namespace brenvik

@@ -27,17 +27,21 @@ class RemoteVoicemailStore final : public VoicemailStore {
   RemoteVoicemailStore(Worker& worker, StoreFolder& folder, std::chrono::milliseconds patience = kPatience)
       : worker_(worker), folder_(folder), patience_(patience) {}
 
-  bool setToken(const std::string* token) noexcept override;
-  bool setTokenForKey(const std::string& key, const std::string& token) noexcept override;
-  bool removeAllRecords() noexcept override;
-  bool readToken(std::optional<std::string>* token) noexcept override;
-  bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept override;
+  void setToken(const std::string* token) override;
+  void setTokenForKey(const std::string& key, const std::string& token) override;
+  void removeAllRecords() override;
+  std::optional<std::string> copyToken() override;
+  std::optional<std::string> copyTokenForKey(const std::string& key) override;
 
  private:
+  using Clock = std::chrono::steady_clock;
   enum class Result { done, failed, outOfMemory };
-  bool perform(stores::Operation operation, const std::string* key, const std::string* token,
-               std::optional<std::string>* found) noexcept;
+  std::optional<std::string> perform(stores::Operation operation, const std::string* key,
+                                     const std::string* token);
   Result exchange(stores::VoicemailRequest* request, stores::VoicemailAnswer* answer);
+  enum class Received { answer, nothing, workerDied, outOfMemory };
+  Received ask(stores::VoicemailRequest* request, const StoreFolder::Opened& folder,
+               Clock::time_point deadline, stores::VoicemailAnswer* answer);
   WorkerResult send(const stores::VoicemailRequest& request, const StoreFolder::Opened& folder);
 
   Worker& worker_;

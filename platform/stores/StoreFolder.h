@@ -30,6 +30,7 @@ class StoreFolder {
   };
 
   virtual ~StoreFolder() = default;
+  // *folder is set with State::open only.
   virtual State open(IfMissing ifMissing, Opened* folder) noexcept = 0;
   // Gives the folder and the store's files in it to "mobile" where they are root's, and either nobody but
   // root can have put them there or everybody may read them. True when something was given.

@@ -17,7 +17,7 @@ namespace brenvik {
 
 // The largest body a response may have, as it travels and decoded, unless its request asks for less.
 inline constexpr std::uint64_t kLargestWebBody = std::uint64_t{512} << 20;
-// The same of a redirect, whose body nobody reads.
+// The same for a redirect, whose body is not used.
 inline constexpr std::uint64_t kLargestRedirectBody = std::uint64_t{64} << 10;
 
 // What several requests have in common. Set it up before the requests are sent.

@@ -18,12 +18,12 @@ struct HeaderNameLess {
   bool operator()(std::string_view left, std::string_view right) const noexcept;
 };
 
-// Header fields by name. Of a field that a response repeats, the values stand joined by ", ".
+// Header fields by name. The values of a repeated field are joined by ", ".
 using HeaderMap = std::map<std::string, std::string, HeaderNameLess>;
 
 enum class WebRequestType : std::int32_t { get = 0 };
 
-// What became of a transfer. `none`, the value 1, says that a whole response came, whatever its status.
+// How a transfer ended. `none`, the value 1, means that a whole response came, with any status.
 enum class WebErrorKind : std::int32_t {
   unknown = 0,
   none = 1,

@@ -24,7 +24,7 @@ using Clock = std::chrono::steady_clock;
 
 // As many as one message can carry on Linux (SCM_MAX_FD). With room for all of them none is dropped by the
 // kernel in this thread, where the last close of a foreign descriptor could wait.
-constexpr std::size_t kMostOnTheWay = 253;
+constexpr std::size_t kMaxInFlightDescriptors = 253;
 
 WorkerResult waitForMessage(int fd, Clock::time_point deadline) noexcept {
   for (;;) {
@@ -42,12 +42,12 @@ WorkerResult waitForMessage(int fd, Clock::time_point deadline) noexcept {
 }
 
 // What waits to be closed: descriptors of four messages at most, and channels that nobody reads any more.
-constexpr std::size_t kMostToClose = 4 * (kMostOnTheWay + 3);
+constexpr std::size_t kMaxToClose = 4 * (kMaxInFlightDescriptors + 3);
 constexpr std::size_t kRoomForChannels = 256;
 
 // See docs/decisions/11-door.md. Never destroyed: a thread of it may be stuck at the end of the process.
 ClosingLine& closingLine() {
-  static ClosingLine* const line = new ClosingLine(kMostToClose);
+  static ClosingLine* const line = new ClosingLine(kMaxToClose);
   return *line;
 }
 
@@ -76,7 +76,7 @@ bool isEmpty(int socket) noexcept {
 
 bool WorkerChannel::hasRoomToDistrust() noexcept {
   try {
-    return closingLine().hasRoomFor(kMostOnTheWay + kRoomForChannels);
+    return closingLine().hasRoomFor(kMaxInFlightDescriptors + kRoomForChannels);
   } catch (const std::bad_alloc&) {
     return false;
   }
@@ -117,11 +117,11 @@ WorkerResult WorkerChannel::makePair(WorkerChannel* one, WorkerChannel* other) n
 WorkerResult WorkerChannel::send(const WorkerMessage& message) noexcept {
   if (!socket_.isValid()) return WorkerResult::closed;
   if (message.payload.size() > WorkerMessage::kLongestPayload ||
-      message.descriptors.size() > WorkerMessage::kMostDescriptors) {
+      message.descriptors.size() > WorkerMessage::kMaxDescriptors) {
     return WorkerResult::malformed;
   }
-  const std::size_t count = std::min(message.descriptors.size(), WorkerMessage::kMostDescriptors);
-  std::array<int, WorkerMessage::kMostDescriptors> descriptors{};
+  const std::size_t count = std::min(message.descriptors.size(), WorkerMessage::kMaxDescriptors);
+  std::array<int, WorkerMessage::kMaxDescriptors> descriptors{};
   for (std::size_t i = 0; i < count; ++i) descriptors[i] = message.descriptors[i].get();
   std::uint32_t kind = message.kind;
   std::array<iovec, 2> pieces{
@@ -129,7 +129,7 @@ WorkerResult WorkerChannel::send(const WorkerMessage& message) noexcept {
   msghdr out{};
   out.msg_iov = pieces.data();
   out.msg_iovlen = pieces.size();
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(WorkerMessage::kMostDescriptors * sizeof(int))> control{};
+  alignas(cmsghdr) std::array<char, CMSG_SPACE(WorkerMessage::kMaxDescriptors * sizeof(int))> control{};
   if (count > 0) {
     const std::size_t bytes = count * sizeof(int);
     out.msg_control = control.data();
@@ -171,8 +171,9 @@ WorkerResult WorkerChannel::receive(WorkerMessage* message, Clock::time_point de
   std::uint32_t kind = 0;
   alignas(8) std::array<std::byte, WorkerMessage::kLongestPayload> bytes;  // written by the kernel only
   std::array<iovec, 2> pieces{{{&kind, sizeof kind}, {bytes.data(), bytes.size()}}};
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(kMostOnTheWay * sizeof(int)) + CMSG_SPACE(sizeof(ucred))>
-      control;
+  alignas(cmsghdr)
+      std::array<char, CMSG_SPACE(kMaxInFlightDescriptors * sizeof(int)) + CMSG_SPACE(sizeof(ucred))>
+          control;
   msghdr in{};
   ssize_t size = -1;
   const bool forEver = deadline == Clock::time_point::max();
@@ -193,7 +194,7 @@ WorkerResult WorkerChannel::receive(WorkerMessage* message, Clock::time_point de
     return errno == ENOMEM || errno == ENOBUFS ? WorkerResult::outOfMemory : WorkerResult::closed;
   }
 
-  std::array<UniqueFd, kMostOnTheWay> received;
+  std::array<UniqueFd, kMaxInFlightDescriptors> received;
   std::size_t count = 0;
   for (cmsghdr* item = CMSG_FIRSTHDR(&in); item != nullptr; item = CMSG_NXTHDR(&in, item)) {
     if (item->cmsg_level != SOL_SOCKET || item->cmsg_type != SCM_RIGHTS) continue;
@@ -216,10 +217,10 @@ WorkerResult WorkerChannel::receive(WorkerMessage* message, Clock::time_point de
   } const dropped{std::span(received).first(count), isDistrusted_};
   if (size == 0) return WorkerResult::closed;
   // There was room for all: what the kernel had to leave out found no free descriptor in this process.
-  if ((in.msg_flags & MSG_CTRUNC) != 0 && count <= WorkerMessage::kMostDescriptors)
+  if ((in.msg_flags & MSG_CTRUNC) != 0 && count <= WorkerMessage::kMaxDescriptors)
     return WorkerResult::outOfMemory;
   if ((in.msg_flags & (MSG_TRUNC | MSG_CTRUNC)) != 0 || static_cast<std::size_t>(size) < sizeof kind ||
-      count > WorkerMessage::kMostDescriptors) {
+      count > WorkerMessage::kMaxDescriptors) {
     return WorkerResult::malformed;
   }
   try {

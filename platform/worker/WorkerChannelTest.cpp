@@ -80,12 +80,12 @@ TEST_F(WorkerChannelTest, AMessageArrivesAsItWasSent) {
 TEST_F(WorkerChannelTest, TheLongestMessageArrivesAndALongerOneIsNotSent) {
   WorkerMessage sent;
   sent.payload.resize(WorkerMessage::kLongestPayload);
-  for (std::size_t i = 0; i < WorkerMessage::kMostDescriptors; ++i)
+  for (std::size_t i = 0; i < WorkerMessage::kMaxDescriptors; ++i)
     sent.descriptors.emplace_back(::dup(STDERR_FILENO));
   ASSERT_EQ(one.send(sent), WorkerResult::done);
   ASSERT_EQ(receiveNow(other), WorkerResult::done);
   EXPECT_EQ(message.payload.size(), WorkerMessage::kLongestPayload);
-  EXPECT_EQ(message.descriptors.size(), WorkerMessage::kMostDescriptors);
+  EXPECT_EQ(message.descriptors.size(), WorkerMessage::kMaxDescriptors);
   sent.payload.resize(WorkerMessage::kLongestPayload + 1);
   EXPECT_EQ(one.send(sent), WorkerResult::malformed);
   sent.payload.clear();

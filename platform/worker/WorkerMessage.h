@@ -14,7 +14,7 @@ namespace brenvik {
 // (WorkerFields.h), is agreed between the two ends of a channel. What comes from a worker is a foreign byte.
 struct WorkerMessage {
   static constexpr std::size_t kLongestPayload = 60'000;  // bytes; with its head it fits one datagram
-  static constexpr std::size_t kMostDescriptors = 4;
+  static constexpr std::size_t kMaxDescriptors = 4;
 
   std::uint32_t kind = 0;
   std::vector<std::byte> payload;

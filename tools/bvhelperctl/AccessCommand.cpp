@@ -103,8 +103,8 @@ void takeExecutable(const Values& values, Asked* asked) {
   if (!S_ISREG(facts.st_mode)) {
     throw UsageError{"--exe: " + printable(asked->executable) + " is not a regular file"};
   }
-  constexpr std::size_t kMostInterpreters = 4;  // the kernel follows no more
-  while (asked->scripts.size() < kMostInterpreters) {
+  constexpr std::size_t kMaxInterpreters = 4;  // the kernel follows no more
+  while (asked->scripts.size() < kMaxInterpreters) {
     auto interpreter = interpreterOf(asked->executable);
     if (!interpreter) break;
     asked->scripts.push_back(std::exchange(asked->executable, std::move(*interpreter)));

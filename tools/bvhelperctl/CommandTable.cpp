@@ -106,7 +106,8 @@ const std::string& domainOfAFile(const std::string& domain) {
 // ---- outcomes -------------------------------------------------------------------------------------------
 
 // Of a routine that answers whether its work succeeded.
-Outcome triedTo(const char* routine, std::int32_t code, bool success, std::string text, std::string failure) {
+Outcome attemptOutcome(const char* routine, std::int32_t code, bool success, std::string text,
+                       std::string failure) {
   Outcome outcome = did(routine, code, std::move(text));
   if (code == BVMH_OK) {
     outcome.isDone = success;
@@ -284,14 +285,14 @@ Outcome copyCarrierFile(bvmh_client* client, const Values& values) {
                    values["DESTINATION-DIR"].c_str(), values["NAME"].c_str(), &success);
   const std::string file = printable(values["NAME"]) + " from " + printable(values["SOURCE-DIR"]) + " to " +
                            printable(values["DESTINATION-DIR"]);
-  return triedTo(name, code, success, "copied " + file, "did not copy " + file);
+  return attemptOutcome(name, code, success, "copied " + file, "did not copy " + file);
 }
 
 Outcome copyCrashLogs(bvmh_client* client, const Values& values) {
   bool success = false;
   BVHELPERCTL_CALL(BVMobileHelperCopyCrashLogs, client, values["PATH"].c_str(), &success);
-  return triedTo(name, code, success, "copied " + printable(values["PATH"]) + " to the crash logs",
-                 "did not copy " + printable(values["PATH"]));
+  return attemptOutcome(name, code, success, "copied " + printable(values["PATH"]) + " to the crash logs",
+                        "did not copy " + printable(values["PATH"]));
 }
 
 Outcome moveBundle(bvmh_client* client, const Values& values) {
@@ -300,7 +301,7 @@ Outcome moveBundle(bvmh_client* client, const Values& values) {
                    values["DESTINATION-DIR"].c_str(), values["NAME"].c_str(), &success);
   const std::string move = printable(values["SOURCE"]) + " to " + printable(values["DESTINATION-DIR"]) + "/" +
                            printable(values["NAME"]);
-  return triedTo(name, code, success, "moved " + move, "did not move " + move);
+  return attemptOutcome(name, code, success, "moved " + move, "did not move " + move);
 }
 
 Outcome unpackArchive(bvmh_client* client, const Values& values) {
@@ -308,7 +309,7 @@ Outcome unpackArchive(bvmh_client* client, const Values& values) {
   BVHELPERCTL_CALL(BVMobileHelperUnpackArchive, client, values["ARCHIVE"].c_str(),
                    values["DESTINATION"].c_str(), &success);
   const std::string what = printable(values["ARCHIVE"]) + " into " + printable(values["DESTINATION"]);
-  return triedTo(name, code, success, "unpacked " + what, "did not unpack " + what);
+  return attemptOutcome(name, code, success, "unpacked " + what, "did not unpack " + what);
 }
 
 Outcome showCountry(bvmh_client* client, const Values&) {
@@ -409,10 +410,10 @@ Outcome remapChannel(bvmh_client* client, const Values& values) {
   const std::string what = "contacts from " + printable(values["FROM"]) + " to " + printable(values["TO"]);
   // The helper answers "done", too, when it cannot open a store, and never how many there were.
   const std::optional<bool> hasStore = hasContactsStore();
-  Outcome outcome =
-      triedTo(name, code, success,
-              hasStore == false ? "no contacts to move: there is no contacts store" : "remapped " + what,
-              "did not move " + what);
+  Outcome outcome = attemptOutcome(
+      name, code, success,
+      hasStore == false ? "no contacts to move: there is no contacts store" : "remapped " + what,
+      "did not move " + what);
   outcome.fields["store"] = hasStore ? nlohmann::ordered_json(*hasStore) : nlohmann::ordered_json();
   return outcome;
 }

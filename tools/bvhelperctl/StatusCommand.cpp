@@ -202,7 +202,7 @@ nlohmann::ordered_json fieldsOf(const StatusReport& report, const std::optional<
                                 {"seconds", secondsOf(report.running)},
                                 {"clients", report.clients},
                                 {"busyTokens", report.busyTokens},
-                                {"heldBy", whatHolds(report)},
+                                {"heldBy", busyReasons(report)},
                                 {"leavesIn", nullptr}};
   if (report.leavesIn) fields["leavesIn"] = secondsOf(*report.leavesIn);
   fields["heartbeat"] = {{"on", report.isHeartbeatOn},
@@ -236,7 +236,7 @@ std::string textOf(const StatusReport& report, const std::optional<std::string>&
   text += '\n' + column("socket") + socketText(fields["socket"]) + '\n';
 
   std::string held;
-  for (const std::string& each : whatHolds(report)) held += (held.empty() ? "" : ", ") + each;
+  for (const std::string& each : busyReasons(report)) held += (held.empty() ? "" : ", ") + each;
   if (held.empty()) {
     held = report.leavesIn ? "nothing: idle, leaves in " +
                                  lasting(std::chrono::ceil<std::chrono::seconds>(*report.leavesIn))

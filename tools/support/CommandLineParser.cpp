@@ -172,7 +172,7 @@ class Walk {
     return {"unknown command " + inQuotes(asked) + suggestion(similar)};
   }
 
-  std::string whatIsMissing() const {
+  std::string missingPart() const {
     if (line_.group.empty()) return "a command is required";
     std::string names;
     for (const CommandSyntax& each : program_.commands) {
@@ -182,7 +182,7 @@ class Walk {
   }
 
   void finish() const {
-    if (command() == nullptr) throw UsageError{whatIsMissing()};
+    if (command() == nullptr) throw UsageError{missingPart()};
     const std::vector<Parameter>& wanted = *command()->positionals;
     if (positionals_ < wanted.size())
       throw UsageError{std::string(wanted[positionals_].name) + " is required"};

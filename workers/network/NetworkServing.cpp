@@ -34,12 +34,12 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 // A channel's question is sent together with it.
-constexpr std::chrono::seconds kLongestForAQuestion{10};
+constexpr std::chrono::seconds kMaxQuestionTime{10};
 
 // The question's message; nothing when none comes.
 std::optional<WorkerMessage> questionOn(WorkerChannel& channel) {
   WorkerMessage message;
-  if (channel.receive(&message, Clock::now() + kLongestForAQuestion) != WorkerResult::done ||
+  if (channel.receive(&message, Clock::now() + kMaxQuestionTime) != WorkerResult::done ||
       message.kind != static_cast<std::uint32_t>(NetworkMessage::ask)) {
     return std::nullopt;
   }
@@ -99,7 +99,7 @@ NetworkServing::NetworkServing(const Parts& parts)
     : parts_(parts), answers_(parts.queues.makeSerial("answers", QualityOfService::standard)) {}
 
 void NetworkServing::start(std::uint32_t work, WorkerChannel channel) noexcept {
-  if (served_.fetch_add(1) < kMostChannels) {
+  if (served_.fetch_add(1) < kMaxChannels) {
     try {
       auto shared = std::make_shared<WorkerChannel>(std::move(channel));
       try {

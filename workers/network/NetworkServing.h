@@ -21,7 +21,7 @@ class NetworkServing {
  public:
   // Channels that are served at a time, on a thread each: twice what the helper keeps open of any sort.
   // Further ones are refused.
-  static constexpr int kMostChannels = 64;
+  static constexpr int kMaxChannels = 64;
 
   // What it works with; all of it outlives it. The client's bodies are for another process (WebBody).
   struct Parts {

@@ -384,7 +384,7 @@ TEST_F(NetworkServingTest, OfAFloodOfQuestionsTheWorkerHasAFewAtATimeAndAllAreAn
             nullptr, callbacks);
   };
   for (int i = 0; i < kQuestions; ++i) ask();
-  while (worker.opened() < static_cast<int>(NetworkAnswers::kMostOpen)) std::this_thread::yield();
+  while (worker.opened() < static_cast<int>(NetworkAnswers::kMaxOpen)) std::this_thread::yield();
   EXPECT_EQ(answered, 0);
   worker.answerWith(WorkerResult::unavailable);
   worker.die();
@@ -500,7 +500,7 @@ TEST_F(NetworkServingTest, ChannelsBeyondTheMostAreRefused) {
     EXPECT_EQ(ours.back().send({static_cast<std::uint32_t>(NetworkMessage::ask), {}, {}}),
               WorkerResult::done);
   };
-  for (int i = 0; i < NetworkServing::kMostChannels; ++i) open();
+  for (int i = 0; i < NetworkServing::kMaxChannels; ++i) open();
   WorkerMessage message;
   EXPECT_EQ(ours.back().receive(&message, std::chrono::steady_clock::now()), WorkerResult::timedOut);
   WorkerChannel theirs;

@@ -51,28 +51,33 @@ class VoicemailService {
   VoicemailAnswer perform(const VoicemailRequest& request) {
     if (!request.insists && isForbidden(request.operation))
       return {.outcome = VoicemailOutcome::notAllowed, .token = {}};
-    VoicemailAnswer answer;
-    const bool hadMemory = run(request, &answer.token);
-    if (!hadMemory) answer = {.outcome = VoicemailOutcome::outOfMemory, .token = {}};
-    return answer;
+    try {
+      return {.token = run(request)};
+    } catch (const std::bad_alloc&) {
+      return {.outcome = VoicemailOutcome::outOfMemory, .token = {}};
+    }
   }
 
-  bool run(const VoicemailRequest& request, std::optional<std::string>* token) noexcept {
+  std::optional<std::string> run(const VoicemailRequest& request) {
     switch (request.operation) {
       case Operation::setToken:
-        return store_.setToken(&request.token);
+        store_.setToken(&request.token);
+        break;
       case Operation::clearToken:
-        return store_.setToken(nullptr);
+        store_.setToken(nullptr);
+        break;
       case Operation::setTokenForKey:
-        return store_.setTokenForKey(request.key, request.token);
+        store_.setTokenForKey(request.key, request.token);
+        break;
       case Operation::removeAllRecords:
-        return store_.removeAllRecords();
+        store_.removeAllRecords();
+        break;
       case Operation::readToken:
-        return store_.readToken(token);
+        return store_.copyToken();
       case Operation::readTokenForKey:
-        return store_.readTokenForKey(request.key, token);
+        return store_.copyTokenForKey(request.key);
     }
-    return true;
+    return std::nullopt;
   }
 
   bool isForbidden(Operation operation) const noexcept {
@@ -106,11 +111,13 @@ class RemapService {
       return false;
     }
     folder_ = std::move(message.descriptors[0]);
-    bool lackedMemory = false;
-    manager_ = contacts_.makeChannelManager(&lackedMemory);
-    *answer = stores::encode(manager_ != nullptr ? stores::ContactsOutcome::open
-                             : lackedMemory      ? stores::ContactsOutcome::outOfMemory
-                                                 : stores::ContactsOutcome::noDatabase);
+    auto outcome = stores::ContactsOutcome::outOfMemory;
+    try {
+      manager_ = contacts_.makeChannelManager();
+      outcome = manager_ != nullptr ? stores::ContactsOutcome::open : stores::ContactsOutcome::noDatabase;
+    } catch (const std::bad_alloc&) {  // is the answer
+    }
+    *answer = stores::encode(outcome);
     return true;
   }
 

@@ -20,11 +20,11 @@ namespace {
 
 // The helper has one for voicemail and one for each remap under way, of which there is one at a time. Those
 // that hang in a file system are what there may be more of.
-constexpr int kMostChannels = 16;
+constexpr int kMaxChannels = 16;
 std::atomic<int> channels{0};
 
 void serveOnItsOwnThread(std::uint32_t work, WorkerChannel channel) {
-  if (channels.fetch_add(1) >= kMostChannels) {
+  if (channels.fetch_add(1) >= kMaxChannels) {
     --channels;
     return;
   }

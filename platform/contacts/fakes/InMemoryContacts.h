@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <new>
 #include <optional>
 #include <string>
 #include <utility>
@@ -17,10 +18,9 @@ namespace brenvik {
 // Contacts in memory, which can be made unreachable or failing.
 class InMemoryContacts final : public ContactsService {
  public:
-  std::unique_ptr<ContactsChannelManager> makeChannelManager(bool* lackedMemory = nullptr) noexcept override {
+  std::unique_ptr<ContactsChannelManager> makeChannelManager() override {
     ++managersAsked;
-    if (lackedMemory != nullptr) *lackedMemory = exhausted;
-    if (exhausted) return nullptr;
+    if (exhausted) throw std::bad_alloc();
     return isReachable ? std::make_unique<Manager>(*this) : nullptr;
   }
 

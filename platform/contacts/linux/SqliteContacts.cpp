@@ -127,16 +127,10 @@ bool SqliteChannelManager::open(int folder) {
 
 }  // namespace
 
-std::unique_ptr<ContactsChannelManager> SqliteContacts::makeChannelManager(bool* lackedMemory) noexcept {
-  if (lackedMemory != nullptr) *lackedMemory = false;
-  try {
-    auto manager = std::make_unique<SqliteChannelManager>(patience_, time_);
-    if (!manager->open(folder_())) return nullptr;
-    return manager;
-  } catch (const std::bad_alloc&) {
-    if (lackedMemory != nullptr) *lackedMemory = true;
-    return nullptr;
-  }
+std::unique_ptr<ContactsChannelManager> SqliteContacts::makeChannelManager() {
+  auto manager = std::make_unique<SqliteChannelManager>(patience_, time_);
+  if (!manager->open(folder_())) return nullptr;
+  return manager;
 }
 
 }  // namespace brenvik

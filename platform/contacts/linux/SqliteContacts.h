@@ -29,7 +29,7 @@ class SqliteContacts final : public ContactsService {
       : folder_(std::move(folder)), patience_(patience), time_(std::move(time)) {}
 
   // Null when there is no folder, no database, none that may be read, or a file that is no database.
-  std::unique_ptr<ContactsChannelManager> makeChannelManager(bool* lackedMemory = nullptr) noexcept override;
+  std::unique_ptr<ContactsChannelManager> makeChannelManager() override;
 
  private:
   const std::function<int()> folder_;

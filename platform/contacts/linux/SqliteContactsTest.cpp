@@ -281,7 +281,7 @@ TEST_F(SqliteContactsTest, TriggersThatWantAllMemoryAreCutOffBeforeTheyHaveMuch)
   makeDatabase("BEGIN;" + triggers + "COMMIT;");
   (void)sqlite()->memory_highwater(1);
   EXPECT_EQ(remap(), "out of memory");
-  EXPECT_LE(sqlite()->memory_highwater(0), kMostSqliteMemory);
+  EXPECT_LE(sqlite()->memory_highwater(0), kMaxSqliteMemory);
   EXPECT_EQ(Application(database()).references("old"), 2);
 }
 
@@ -299,10 +299,10 @@ TEST_F(SqliteContactsTest, ASchemaLargerThanTheMemoryAllowedIsALackOfMemoryAndNo
       "PRAGMA writable_schema=ON; INSERT INTO sqlite_master WITH RECURSIVE n(i) AS "
       "(SELECT 1 UNION ALL SELECT i + 1 FROM n WHERE i < 1000) SELECT 'view', 'v' || i, 'v' || i, 0, "
       "'CREATE VIEW v' || i || ' AS SELECT ''' || hex(zeroblob(25000)) || ''' AS c' FROM n;");
-  (void)sqlite()->hard_heap_limit64(kMostSqliteMemory);
+  (void)sqlite()->hard_heap_limit64(kMaxSqliteMemory);
   (void)sqlite()->memory_highwater(1);
   EXPECT_EQ(remap(), "out of memory");
-  EXPECT_LE(sqlite()->memory_highwater(0), kMostSqliteMemory);
+  EXPECT_LE(sqlite()->memory_highwater(0), kMaxSqliteMemory);
 }
 
 TEST_F(SqliteContactsTest, APipeInTheJournalsPlaceKeepsNobodyWaiting) {

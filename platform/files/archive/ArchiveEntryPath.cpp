@@ -12,7 +12,7 @@ namespace {
 constexpr std::size_t kLongestName = 255;
 constexpr std::size_t kLongestPath = 1024;
 // A walk of the tree holds two descriptors a level.
-constexpr std::size_t kDeepest = 100;
+constexpr std::size_t kMaxDepth = 100;
 
 bool hasOnlyPlainBytes(std::string_view text) {
   for (const char c : text) {
@@ -41,7 +41,7 @@ bool isCleanEntryPath(std::string_view path) noexcept {
   if (!hasOnlyPlainBytes(path) || !isValidUtf8(path)) return false;
   std::size_t depth = 0;
   while (!path.empty()) {
-    if (!isPlainName(takeName(&path)) || ++depth > kDeepest) return false;
+    if (!isPlainName(takeName(&path)) || ++depth > kMaxDepth) return false;
   }
   return true;
 }

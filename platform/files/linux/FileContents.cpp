@@ -17,6 +17,8 @@
 #include <new>
 #include <string>
 
+#include "platform/base/WriteAll.h"
+
 namespace brenvik {
 namespace {
 
@@ -30,35 +32,12 @@ constexpr off_t kWorthReserving = 1 << 20;
 // As much of the source as is mapped at once: it counts as this process's memory.
 constexpr off_t kWindow = 1 << 20;
 
-int writeAll(int file, const char* bytes, std::size_t count, off_t offset) {
-  while (count > 0) {
-    const ssize_t put = ::pwrite(file, bytes, count, offset);
-    if (put < 0 && errno == EINTR) continue;
-    if (put < 0) return errno;
-    if (put == 0) return EIO;
-    bytes += put;
-    count -= static_cast<std::size_t>(put);
-    offset += put;
-  }
-  return 0;
-}
-
 bool meansUnsupported(int error) {
   return error == EXDEV || error == EINVAL || error == ENOSYS || error == EOPNOTSUPP || error == ENOTTY ||
          error == EPERM || error == ETXTBSY;
 }
 
 }  // namespace
-
-int writeAll(int file, std::string_view bytes) noexcept {
-  while (!bytes.empty()) {
-    const ssize_t put = ::write(file, bytes.data(), bytes.size());
-    if (put < 0 && errno == EINTR) continue;
-    if (put < 0) return errno;
-    bytes.remove_prefix(static_cast<std::size_t>(put));
-  }
-  return 0;
-}
 
 char* FileContents::buffer() {
   // On a page's start: from elsewhere the kernel's copying takes 1.7 times as long.
@@ -77,7 +56,7 @@ int FileContents::copyMapped(int source, int destination, off_t* offset, off_t e
     void* const mapped = ::mmap(nullptr, length, PROT_READ, MAP_SHARED | MAP_POPULATE, source, *offset);
     if (mapped == MAP_FAILED) return 0;  // not every file system has mappings
     // Only the kernel touches the mapping: where the file was shortened it says EFAULT, and nobody is killed.
-    const int error = writeAll(destination, static_cast<const char*>(mapped), length, *offset);
+    const int error = writeAllAt(destination, *offset, {static_cast<const char*>(mapped), length});
     (void)::munmap(mapped, length);
     if (error == EFAULT) return 0;
     if (error != 0) return error;
@@ -109,7 +88,8 @@ int FileContents::copyRange(int source, int destination, off_t* offset, off_t en
     if (got < 0 && errno == EINTR) continue;
     if (got < 0) return errno;
     if (got == 0) return 0;
-    if (const int error = writeAll(destination, bytes, static_cast<std::size_t>(got), *offset); error != 0) {
+    if (const int error = writeAllAt(destination, *offset, {bytes, static_cast<std::size_t>(got)});
+        error != 0) {
       return error;
     }
     *offset += got;
@@ -124,40 +104,34 @@ int FileContents::copyRest(int source, int destination, off_t offset) {
     const ssize_t got = ::pread(source, bytes, kBufferSize, offset);
     if (got < 0 && errno == EINTR) continue;
     if (got <= 0) return got == 0 ? 0 : errno;
-    if (const int error = writeAll(destination, bytes, static_cast<std::size_t>(got), offset); error != 0) {
+    if (const int error = writeAllAt(destination, offset, {bytes, static_cast<std::size_t>(got)});
+        error != 0) {
       return error;
     }
     offset += got;
   }
 }
 
-int FileContents::copyData(int source, const struct stat& info, int destination) {
-  // A file without blocks may have content that is made when it is read.
-  if (info.st_size == 0) return copyRest(source, destination, 0);
-  const bool sparse = info.st_blocks * 512 < info.st_size;
-  off_t done = 0;
-  if (info.st_size <= kSmallFile && !sparse) return copyRange(source, destination, &done, info.st_size);
-  if (tryClone_) {
-    if (::ioctl(destination, FICLONE, source) == 0) return 0;
-    if (!meansUnsupported(errno)) return errno;
-    tryClone_ = false;
+// A file without holes, from *offset on. 0 or errno.
+int FileContents::copyDense(int source, const struct stat& info, int destination, off_t* offset) {
+  // All blocks in one request: a full disk shows before the first byte, and writing is a tenth cheaper.
+  struct statfs system {};
+  // Not on tmpfs, which would fill every page with zeros for it.
+  const bool isLarge = info.st_size >= kWorthReserving && ::fstatfs(destination, &system) == 0;
+  if (isLarge && system.f_type != TMPFS_MAGIC && ::fallocate(destination, 0, 0, info.st_size) != 0 &&
+      (errno == ENOSPC || errno == EDQUOT || errno == EFBIG)) {
+    return errno;
   }
-  if (!sparse) {
-    // All blocks in one request: a full disk shows before the first byte, and writing is a tenth cheaper.
-    struct statfs system {};
-    // Not on tmpfs, which would fill every page with zeros for it.
-    const bool isLarge = info.st_size >= kWorthReserving && ::fstatfs(destination, &system) == 0;
-    if (isLarge && system.f_type != TMPFS_MAGIC && ::fallocate(destination, 0, 0, info.st_size) != 0 &&
-        (errno == ENOSPC || errno == EDQUOT || errno == EFBIG)) {
-      return errno;
-    }
-    // Where both ends are in this machine's memory; elsewhere the file system may do it alone.
-    if (isLarge && (system.f_type == EXT4_SUPER_MAGIC || system.f_type == F2FS_SUPER_MAGIC ||
-                    system.f_type == TMPFS_MAGIC)) {
-      if (const int error = copyMapped(source, destination, &done, info.st_size); error != 0) return error;
-    }
-    return copyRange(source, destination, &done, info.st_size);
+  // Where both ends are in this machine's memory; elsewhere the file system may do it alone.
+  if (isLarge && (system.f_type == EXT4_SUPER_MAGIC || system.f_type == F2FS_SUPER_MAGIC ||
+                  system.f_type == TMPFS_MAGIC)) {
+    if (const int error = copyMapped(source, destination, offset, info.st_size); error != 0) return error;
   }
+  return copyRange(source, destination, offset, info.st_size);
+}
+
+// A file with holes, from its start. 0 or errno.
+int FileContents::copySparse(int source, const struct stat& info, int destination) {
   for (off_t at = 0; at < info.st_size;) {
     const off_t data = ::lseek(source, at, SEEK_DATA);
     if (data < 0 && errno == ENXIO) break;  // a hole to the end
@@ -170,6 +144,20 @@ int FileContents::copyData(int source, const struct stat& info, int destination)
     if (at < end) return 0;  // shorter than it said: no zeros take the place of what is not there
   }
   return ::ftruncate(destination, info.st_size) == 0 ? 0 : errno;
+}
+
+int FileContents::copyData(int source, const struct stat& info, int destination) {
+  // A file without blocks may have content that is made when it is read.
+  if (info.st_size == 0) return copyRest(source, destination, 0);
+  const bool isSparse = info.st_blocks * 512 < info.st_size;
+  off_t done = 0;
+  if (info.st_size <= kSmallFile && !isSparse) return copyRange(source, destination, &done, info.st_size);
+  if (tryClone_) {
+    if (::ioctl(destination, FICLONE, source) == 0) return 0;
+    if (!meansUnsupported(errno)) return errno;
+    tryClone_ = false;
+  }
+  return isSparse ? copySparse(source, info, destination) : copyDense(source, info, destination, &done);
 }
 
 int FileContents::copyExtendedAttributes(int source, int destination) {

@@ -6,12 +6,8 @@
 
 #include <cstdlib>
 #include <memory>
-#include <string_view>
 
 namespace brenvik {
-
-// Writes all the bytes at the file's position. 0 or errno. Any thread.
-int writeAll(int file, std::string_view bytes) noexcept;
 
 // Copies what a file is beside its name: its data, and its attributes. Keeps a buffer and what it learned
 // about the file systems between calls; make one for a request. One thread.
@@ -36,6 +32,8 @@ class FileContents {
   int copyMapped(int source, int destination, off_t* offset, off_t end);
   int copyRange(int source, int destination, off_t* offset, off_t end);
   int copyRest(int source, int destination, off_t offset);
+  int copyDense(int source, const struct stat& info, int destination, off_t* offset);
+  int copySparse(int source, const struct stat& info, int destination);
   int copyExtendedAttributes(int source, int destination);
 
   struct Free {

@@ -12,7 +12,7 @@ namespace brenvik {
 // come back through "..", so that no tree can use up the process's descriptors.
 inline constexpr std::size_t kHeldLevels = 48;
 
-// A directory of a walk, whose descriptor may be given up and taken again from a directory inside it.
+// A directory of a walk. Its descriptor may be closed, and opened again from a directory inside it.
 class HeldDirectory {
  public:
   HeldDirectory() = default;

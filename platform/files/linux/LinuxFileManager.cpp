@@ -5,7 +5,6 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <grp.h>
-#include <pwd.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -13,6 +12,9 @@
 #include <cstdio>
 #include <new>
 
+#include "platform/base/Guarded.h"
+#include "platform/base/PasswordEntry.h"
+#include "platform/base/WriteAll.h"
 #include "platform/files/linux/DirectoryNames.h"
 #include "platform/files/linux/Durability.h"
 #include "platform/files/linux/FileContents.h"
@@ -24,15 +26,11 @@
 namespace brenvik {
 namespace {
 
-// Runs `work`, which answers 0 or an errno value, at the boundary that nothing is thrown across.
+// Runs `work`, which returns 0 or an errno value.
 template <typename Work>
-FileOutcome guarded(Work work) noexcept {
-  try {
-    const int error = work();
-    return error == 0 ? FileOutcome::success() : FileOutcome::failure(error);
-  } catch (const std::bad_alloc&) {
-    return FileOutcome::failure(ENOMEM);
-  }
+FileOutcome outcomeOf(Work work) noexcept {
+  const int error = guarded(ENOMEM, work);
+  return error == 0 ? FileOutcome::success() : FileOutcome::failure(error);
 }
 
 bool isSameItem(const struct stat& a, const struct stat& b) {
@@ -57,12 +55,10 @@ bool isInside(int directory, const struct stat& tree) {
 }
 
 int idOfUser(std::string_view name, uid_t* uid) {
-  char buffer[4096];
-  passwd entry{};
-  passwd* found = nullptr;
-  const int error = ::getpwnam_r(std::string(name).c_str(), &entry, buffer, sizeof buffer, &found);
-  if (found == nullptr) return error != 0 ? error : EINVAL;
-  *uid = found->pw_uid;
+  std::optional<PasswordEntry> entry;
+  const int error = readPasswordEntry(std::string(name).c_str(), &entry);
+  if (!entry) return error != 0 ? error : EINVAL;
+  *uid = entry->uid;
   return 0;
 }
 
@@ -257,7 +253,7 @@ FileContents& LinuxFileManager::contents() {
 
 bool LinuxFileManager::itemExists(const std::string& path, bool* isDirectory) noexcept {
   struct stat info {};
-  const bool exists = guarded([&] {
+  const bool exists = outcomeOf([&] {
                         UniqueFd item;
                         if (const int error = openToRead(path, O_PATH, &item); error != 0) return error;
                         return ::fstat(item.get(), &info) == 0 ? 0 : errno;
@@ -266,42 +262,54 @@ bool LinuxFileManager::itemExists(const std::string& path, bool* isDirectory) no
   return exists;
 }
 
-// Makes a copy of the item in the stage, with everything on the disk but its name where that is asked for.
-// *info: of the item; then of what was opened. 0 or errno. Whether the gift was given is its outcome.
+// Gives the item to the gift's owner and notes how that went.
+void LinuxFileManager::give(int item, Gift* gift) {
+  if (gift == nullptr) return;
+  struct stat made {};
+  const int error = ::fstat(item, &made) != 0 ? errno : apply(gift->attributes, item, made);
+  gift->outcome = error == 0 ? FileOutcome::success() : FileOutcome::failure(error);
+}
+
+// Copies a link, a pipe, a socket or a device into the stage. 0 or errno.
+int LinuxFileManager::stageSpecial(TreeCopier& copier, const Place& from, const struct stat& info,
+                                   Stage& stage, Gift* gift) {
+  if (const int error = stage.makeRoom(); error != 0) return error;
+  const int room = stage.room();
+  const int error =
+      copier.copySpecial(from.directory.get(), from.name.c_str(), info, room, Stage::itemName());
+  if (error != 0) return error;
+  const UniqueFd made(::openat(room, Stage::itemName(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  give(made.get(), gift);
+  return 0;
+}
+
+// Copies an opened file or directory into the stage. 0 or errno.
+int LinuxFileManager::stageContents(TreeCopier& copier, int item, const struct stat& info, const Place& to,
+                                    Stage& stage) {
+  if (S_ISDIR(info.st_mode)) {
+    if (isInside(to.directory.get(), info)) return EINVAL;
+    const int error = stage.makeDirectory();
+    return error != 0 ? error : copier.copyDirectoryInto(item, info, stage.get());
+  }
+  if (!S_ISREG(info.st_mode)) return EBUSY;
+  const int error = stage.makeFile();
+  return error != 0 ? error : copier.copyFileInto(item, info, stage.get());
+}
+
+// Makes a copy of the item in the stage. With Durability::onReturn everything but the copy's name is on the
+// disk then. *info is the item's; afterwards it is that of what was opened. Returns 0 or errno. Whether the
+// gift was given is the gift's own outcome.
 int LinuxFileManager::stageCopy(const Place& from, struct stat* info, const Place& to, Stage& stage,
                                 TreeCopier::Source afterwards, Durability durability, Gift* gift) {
   TreeCopier copier(contents(), ::geteuid(), ::getegid(), afterwards);
-  const char* const source = from.name.c_str();
   const bool isDirectory = S_ISDIR(info->st_mode);
-  const auto give = [&](int item) {
-    if (gift == nullptr) return;
-    struct stat made {};
-    const int error = ::fstat(item, &made) != 0 ? errno : apply(gift->attributes, item, made);
-    gift->outcome = error == 0 ? FileOutcome::success() : FileOutcome::failure(error);
-  };
-  if (!isDirectory && !S_ISREG(info->st_mode)) {
-    if (const int error = stage.makeRoom(); error != 0) return error;
-    const int room = stage.room();
-    const int error = copier.copySpecial(from.directory.get(), source, *info, room, Stage::itemName());
-    if (error != 0) return error;
-    const UniqueFd made(::openat(room, Stage::itemName(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-    give(made.get());
-    return 0;
-  }
+  if (!isDirectory && !S_ISREG(info->st_mode)) return stageSpecial(copier, from, *info, stage, gift);
   const UniqueFd item(
-      ::openat(from.directory.get(), source,
+      ::openat(from.directory.get(), from.name.c_str(),
                O_RDONLY | O_NOFOLLOW | O_CLOEXEC | (isDirectory ? O_DIRECTORY : O_NONBLOCK | O_NOCTTY)));
   if (!item.isValid() || ::fstat(item.get(), info) != 0) return errno;
-  if (isDirectory) {
-    if (isInside(to.directory.get(), *info)) return EINVAL;
-    if (const int error = stage.makeDirectory(); error != 0) return error;
-    if (const int error = copier.copyDirectoryInto(item.get(), *info, stage.get()); error != 0) return error;
-  } else {
-    if (!S_ISREG(info->st_mode)) return EBUSY;
-    if (const int error = stage.makeFile(); error != 0) return error;
-    if (const int error = copier.copyFileInto(item.get(), *info, stage.get()); error != 0) return error;
-  }
-  give(stage.get());
+  if (const int error = stageContents(copier, item.get(), *info, to, stage); error != 0) return error;
+  give(stage.get(), gift);
   if (durability == Durability::eventual) return 0;
   return isDirectory ? syncFileSystem(stage.get()) : syncFile(stage.get());
 }
@@ -358,6 +366,61 @@ int LinuxFileManager::moveAcross(const Place& from, const Place& to, IfPresent i
   return error;
 }
 
+namespace {
+
+int renamed(const Place& from, const Place& to) {
+  return ::renameat(from.directory.get(), from.name.c_str(), to.directory.get(), to.name.c_str()) == 0
+             ? 0
+             : errno;
+}
+
+int renamedWith(unsigned flags, const Place& from, const Place& to) {
+  return ::renameat2(from.directory.get(), from.name.c_str(), to.directory.get(), to.name.c_str(), flags) == 0
+             ? 0
+             : errno;
+}
+
+int statOf(const Place& place, struct stat* info) {
+  return ::fstatat(place.directory.get(), place.name.c_str(), info, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
+}
+
+int unlinked(const Place& place) {
+  return ::unlinkat(place.directory.get(), place.name.c_str(), 0) == 0 ? 0 : errno;
+}
+
+// Renames unless something stands at the new place. 0 or errno: EEXIST when something does.
+int renameToFreePlace(const Place& from, const Place& to) {
+  const int error = renamedWith(RENAME_NOREPLACE, from, to);
+  if (error != EINVAL && error != ENOSYS) return error;
+  // A file system without the flag, or a directory into itself, which the plain call refuses as well.
+  struct stat there {};
+  return statOf(to, &there) == 0 ? EEXIST : renamed(from, to);
+}
+
+// Two names of one file: the old one goes. 0 or errno.
+int dropOtherName(const Place& from, const Place& to) {
+  // rename(2) leaves two names of one file alone. They may even be one name.
+  struct stat a {};
+  struct stat b {};
+  if (::fstat(from.directory.get(), &a) != 0 || ::fstat(to.directory.get(), &b) != 0) return errno;
+  return from.name == to.name && isSameItem(a, b) ? 0 : unlinked(from);
+}
+
+// Renames onto what stands at the new place, which is not a directory. `info`: of the item. 0 or errno:
+// EEXIST when it is a directory.
+int renameOnto(const Place& from, const struct stat& info, const Place& to) {
+  struct stat there {};
+  if (const int error = statOf(to, &there); error != 0) return error;
+  if (S_ISDIR(there.st_mode)) return EEXIST;
+  if (isSameItem(info, there)) return dropOtherName(from, to);
+  if (!S_ISDIR(info.st_mode)) return renamed(from, to);
+  // A directory replaces no file by rename(2), so the two change places first.
+  const int error = renamedWith(RENAME_EXCHANGE, from, to);
+  return error != 0 ? error : unlinked(from);
+}
+
+}  // namespace
+
 int LinuxFileManager::move(const std::string& source, const std::string& destination, IfPresent ifPresent,
                            Durability durability) {
   Place from;
@@ -365,63 +428,34 @@ int LinuxFileManager::move(const std::string& source, const std::string& destina
   // EEXIST: "." and ".." name no entry that could be taken away.
   if (const int error = openPlace(source, &from); error != 0) return error == EEXIST ? EBUSY : error;
   if (const int error = openPlace(destination, &to); error != 0) return error;
-  const int fromDirectory = from.directory.get();
-  const int toDirectory = to.directory.get();
-  const char* const fromName = from.name.c_str();
-  const char* const toName = to.name.c_str();
   struct stat info {};
-  if (::fstatat(fromDirectory, fromName, &info, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+  if (const int error = statOf(from, &info); error != 0) return error;
   if (!S_ISDIR(info.st_mode) && (source.ends_with('/') || destination.ends_with('/'))) return ENOTDIR;
 
-  int error = ::renameat2(fromDirectory, fromName, toDirectory, toName, RENAME_NOREPLACE) == 0 ? 0 : errno;
-  struct stat there {};
-  if (error == EINVAL || error == ENOSYS) {
-    // A file system without the flag, or a directory into itself, which the plain call refuses as well.
-    if (::fstatat(toDirectory, toName, &there, AT_SYMLINK_NOFOLLOW) == 0) {
-      error = EEXIST;
-    } else {
-      error = ::renameat(fromDirectory, fromName, toDirectory, toName) == 0 ? 0 : errno;
-    }
-  }
-  if (error == EEXIST && ifPresent == IfPresent::replaceNonDirectory) {
-    if (::fstatat(toDirectory, toName, &there, AT_SYMLINK_NOFOLLOW) != 0) return errno;
-    if (S_ISDIR(there.st_mode)) return EEXIST;
-    if (isSameItem(info, there)) {
-      // rename(2) leaves two names of one file alone. They may even be one name.
-      struct stat a {};
-      struct stat b {};
-      if (::fstat(fromDirectory, &a) != 0 || ::fstat(toDirectory, &b) != 0) return errno;
-      if (from.name == to.name && isSameItem(a, b)) return 0;
-      error = ::unlinkat(fromDirectory, fromName, 0) == 0 ? 0 : errno;
-    } else if (!S_ISDIR(info.st_mode)) {
-      error = ::renameat(fromDirectory, fromName, toDirectory, toName) == 0 ? 0 : errno;
-    } else if (::renameat2(fromDirectory, fromName, toDirectory, toName, RENAME_EXCHANGE) == 0) {
-      error = ::unlinkat(fromDirectory, fromName, 0) == 0 ? 0 : errno;
-    } else {
-      error = errno;
-    }
-  }
+  int error = renameToFreePlace(from, to);
+  if (error == EEXIST && ifPresent == IfPresent::replaceNonDirectory) error = renameOnto(from, info, to);
   if (error == EXDEV) return moveAcross(from, to, ifPresent);
   if (error != 0 || durability == Durability::eventual) return error;
   // The new name first: a power cut in between leaves both, and not none.
-  if (const int failed = syncNames(toDirectory); failed != 0) return failed;
-  return syncNames(fromDirectory);
+  if (const int failed = syncNames(to.directory.get()); failed != 0) return failed;
+  return syncNames(from.directory.get());
 }
 
 FileOutcome LinuxFileManager::copyItem(const std::string& source, const std::string& destination,
                                        IfPresent ifPresent, Durability durability, Gift* gift) noexcept {
-  const FileOutcome outcome = guarded([&] { return copy(source, destination, ifPresent, durability, gift); });
+  const FileOutcome outcome =
+      outcomeOf([&] { return copy(source, destination, ifPresent, durability, gift); });
   if (gift != nullptr && !outcome.succeeded()) gift->outcome = outcome;
   return outcome;
 }
 
 FileOutcome LinuxFileManager::moveItem(const std::string& source, const std::string& destination,
                                        IfPresent ifPresent, Durability durability) noexcept {
-  return guarded([&] { return move(source, destination, ifPresent, durability); });
+  return outcomeOf([&] { return move(source, destination, ifPresent, durability); });
 }
 
 FileOutcome LinuxFileManager::removeItem(const std::string& path) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     Place place;
     const int error = Place::open(path, &place);
     return error != 0 ? error : removeTree(place.directory.get(), place.name.c_str());
@@ -429,7 +463,7 @@ FileOutcome LinuxFileManager::removeItem(const std::string& path) noexcept {
 }
 
 FileOutcome LinuxFileManager::removeEntry(const std::string& path) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     Place place;
     if (const int error = openPlace(path, &place); error != 0) return error;
     const int directory = place.directory.get();
@@ -444,7 +478,7 @@ FileOutcome LinuxFileManager::removeEntry(const std::string& path) noexcept {
 }
 
 FileOutcome LinuxFileManager::placeLink(const std::string& path, const std::string& target) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     if (path.ends_with('/')) return ENOTDIR;  // no link has such a name
     Place place;
     if (const int error = openPlace(path, &place); error != 0) return error;
@@ -454,7 +488,7 @@ FileOutcome LinuxFileManager::placeLink(const std::string& path, const std::stri
 }
 
 FileOutcome LinuxFileManager::syncItem(const std::string& path) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     Place place;
     if (const int error = Place::openExisting(path, &place, Links::unchangeable); error != 0) return error;
     struct stat info {};
@@ -472,7 +506,7 @@ FileOutcome LinuxFileManager::syncItem(const std::string& path) noexcept {
 
 FileOutcome LinuxFileManager::createDirectory(const std::string& path, const DirectoryAttributes& attributes,
                                               Intermediates intermediates) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     ResolvedAttributes resolved{attributes.mode & 07777};
     if (!attributes.ownerName.empty()) {
       if (const int error = idOfUser(attributes.ownerName, &resolved.uid); error != 0) return error;
@@ -487,7 +521,7 @@ FileOutcome LinuxFileManager::createDirectory(const std::string& path, const Dir
 
 FileOutcome LinuxFileManager::listDirectory(const std::string& path,
                                             std::vector<std::string>* names) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     UniqueFd directory;
     if (const int error = openToRead(path, O_RDONLY | O_DIRECTORY, &directory); error != 0) return error;
     DirectoryNames entries;
@@ -499,7 +533,7 @@ FileOutcome LinuxFileManager::listDirectory(const std::string& path,
 }
 
 FileOutcome LinuxFileManager::enumerateBelow(const std::string& path, ItemVisitor& visitor) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
     UniqueFd top;
     if (const int error = openDirectory(path, &top, Links::own); error != 0) return error;
     UniqueFd names = openForNames(top.get());
@@ -528,46 +562,54 @@ int LinuxFileManager::change(const std::string& path, const ItemAttributes& attr
 
 FileOutcome LinuxFileManager::setAttributes(const std::string& path, const ItemAttributes& attributes,
                                             ItemKinds kinds) noexcept {
-  return guarded([&] { return change(path, attributes, kinds, Reach::item); });
+  return outcomeOf([&] { return change(path, attributes, kinds, Reach::item); });
 }
 
 FileOutcome LinuxFileManager::setAttributesOfTree(const std::string& path,
                                                   const ItemAttributes& attributes) noexcept {
-  return guarded([&] { return change(path, attributes, ItemKinds::all, Reach::tree); });
+  return outcomeOf([&] { return change(path, attributes, ItemKinds::all, Reach::tree); });
 }
 
+namespace {
+
+// All of the file, which says that it has `size` bytes; nothing when it has more than `limit` or cannot be
+// read.
+std::optional<std::string> readAll(int file, std::size_t size, std::size_t limit) {
+  std::string bytes;
+  // One byte more than it should have: the read that gets nothing ends it. Some files say they are empty.
+  std::size_t length = 0;
+  bytes.resize(size + 1);
+  for (;;) {
+    if (length == bytes.size()) {
+      if (length > limit) return std::nullopt;
+      bytes.resize(length + 65536);
+    }
+    const ssize_t got = ::read(file, bytes.data() + length, bytes.size() - length);
+    if (got < 0 && errno == EINTR) continue;
+    if (got < 0) return std::nullopt;
+    if (got == 0) break;
+    length += static_cast<std::size_t>(got);
+  }
+  if (length > limit) return std::nullopt;
+  bytes.resize(length);
+  return bytes;
+}
+
+}  // namespace
+
 std::optional<std::string> LinuxFileManager::readFile(const std::string& path, std::size_t limit) noexcept {
-  try {
+  return guarded(std::optional<std::string>(), [&]() -> std::optional<std::string> {
     UniqueFd file;
     struct stat info {};
     if (openToRead(path, O_RDONLY | O_NONBLOCK | O_NOCTTY, &file) != 0) return std::nullopt;
     if (::fstat(file.get(), &info) != 0 || !S_ISREG(info.st_mode)) return std::nullopt;
-    if (static_cast<std::size_t>(info.st_size) > limit) return std::nullopt;
-    std::string bytes;
-    // One byte more than it should have: the read that gets nothing ends it. Some files say they are empty.
-    std::size_t length = 0;
-    bytes.resize(static_cast<std::size_t>(info.st_size) + 1);
-    for (;;) {
-      if (length == bytes.size()) {
-        if (length > limit) return std::nullopt;
-        bytes.resize(length + 65536);
-      }
-      const ssize_t got = ::read(file.get(), bytes.data() + length, bytes.size() - length);
-      if (got < 0 && errno == EINTR) continue;
-      if (got < 0) return std::nullopt;
-      if (got == 0) break;
-      length += static_cast<std::size_t>(got);
-    }
-    if (length > limit) return std::nullopt;
-    bytes.resize(length);
-    return bytes;
-  } catch (const std::bad_alloc&) {
-    return std::nullopt;
-  }
+    const auto size = static_cast<std::size_t>(info.st_size);
+    return size > limit ? std::nullopt : readAll(file.get(), size, limit);
+  });
 }
 
 bool LinuxFileManager::writeFileAtomically(const std::string& path, std::string_view bytes) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
            Place place;
            if (const int error = openPlace(path, &place); error != 0) return error;
            struct stat there {};
@@ -592,7 +634,7 @@ bool LinuxFileManager::writeFileAtomically(const std::string& path, std::string_
 }
 
 bool LinuxFileManager::writeFile(const std::string& path, std::string_view bytes) noexcept {
-  return guarded([&] {
+  return outcomeOf([&] {
            Place place;
            if (const int error = openPlace(path, &place); error != 0) return error;
            const UniqueFd file(::openat(place.directory.get(), place.name.c_str(),

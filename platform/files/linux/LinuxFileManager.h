@@ -52,6 +52,9 @@ class LinuxFileManager final : public FileManager {
   int move(const std::string& source, const std::string& destination, IfPresent ifPresent,
            Durability durability);
   int moveAcross(const Place& from, const Place& to, IfPresent ifPresent);
+  void give(int item, Gift* gift);
+  int stageSpecial(TreeCopier& copier, const Place& from, const struct stat& info, Stage& stage, Gift* gift);
+  int stageContents(TreeCopier& copier, int item, const struct stat& info, const Place& to, Stage& stage);
   int stageCopy(const Place& from, struct stat* info, const Place& to, Stage& stage,
                 TreeCopier::Source afterwards, Durability durability, Gift* gift = nullptr);
   enum class Reach { item, tree };

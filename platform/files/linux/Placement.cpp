@@ -42,8 +42,8 @@ constexpr std::string_view kPrefix = ".brenvik-";
 constexpr std::size_t kRoomDigits = 16;
 constexpr int kAttempts = 8;
 // Of what is looked at in one folder: whoever may write there can fill it. The rest waits for another time.
-constexpr std::size_t kMostEntries = 20'000;
-constexpr int kMostHidden = 1'000;
+constexpr std::size_t kMaxEntries = 20'000;
+constexpr int kMaxHidden = 1'000;
 
 using HiddenName = char[48];
 
@@ -164,12 +164,12 @@ int renameOver(int directory, const char* from, const char* to) {
 void removeLeftovers(int directory) {
   const UniqueFd here(::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   DirectoryNames names;
-  if (!here.isValid() || names.load(here.get(), kMostEntries) != 0) return;
+  if (!here.isValid() || names.load(here.get(), kMaxEntries) != 0) return;
   int hidden = 0;
   for (DirectoryNames::Entry entry{}; names.next(&entry);) {
     const std::string_view name = entry.name;
     if (!name.starts_with(kPrefix)) continue;
-    if (++hidden > kMostHidden) return;
+    if (++hidden > kMaxHidden) return;
     if (entry.type == DT_DIR && name.size() == kPrefix.size() + kRoomDigits) {
       removeStaleRoom(here.get(), entry.name);
     }

@@ -14,11 +14,11 @@
 namespace brenvik {
 
 // Removes what killed processes have left in the directory: what a Stage or placeLink() had made there, and
-// nothing else. How that is told: see hidden names in Placement.cpp. May throw std::bad_alloc.
+// nothing else. Placement.cpp says how it recognises them (hidden names). May throw std::bad_alloc.
 void removeLeftovers(int directory);
 
 // Makes a symbolic link at the place. What stands there gives way in one step; an empty directory is removed
-// first. 0 or errno; then what was there stands there still.
+// first. 0, or errno and nothing has changed.
 int placeLink(const Place& place, const std::string& target);
 
 // A new item in the making. It stands in a hidden directory beside its place, which only this process's

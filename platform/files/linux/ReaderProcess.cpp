@@ -75,6 +75,15 @@ int ReaderProcess::start(const std::string& program, int input) {
   return error;
 }
 
+// Waits until the reader has written something, or `patience` is over. 0 or errno.
+int ReaderProcess::awaitOutput(std::chrono::milliseconds patience) const noexcept {
+  constexpr std::int64_t kLongestWait = 60'000;  // ms: fits poll(2), and the caller looks at its clock again
+  pollfd ready{output_.get(), POLLIN, 0};
+  const int polled =
+      ::poll(&ready, 1, static_cast<int>(std::min<std::int64_t>(patience.count(), kLongestWait)));
+  return polled < 0 && errno != EINTR ? errno : 0;
+}
+
 int ReaderProcess::drain(std::chrono::steady_clock::time_point deadline, ReaderOutput& to) {
   // On a page's start, like the pieces asked for: from elsewhere the kernel's copying takes 1.7 times as
   // long.
@@ -92,24 +101,22 @@ int ReaderProcess::drain(std::chrono::steady_clock::time_point deadline, ReaderO
     const ssize_t got = isDirect ? ::splice(output_.get(), nullptr, direct.file, nullptr, direct.bytes,
                                             SPLICE_F_MOVE | SPLICE_F_NONBLOCK)
                                  : ::read(output_.get(), buffer.get(), std::min(kBuffer, to.bestPiece()));
-    if (got < 0 && errno == EAGAIN) {
-      pollfd ready{output_.get(), POLLIN, 0};
-      const int polled = ::poll(&ready, 1, static_cast<int>(std::min<std::int64_t>(left.count(), 60'000)));
-      if (polled < 0 && errno != EINTR) return errno;
-      continue;
-    }
-    if (got < 0 && errno == EINTR) continue;
-    if (got < 0 && isDirect && (errno == EINVAL || errno == ENOSYS || errno == EPERM)) {
+    int error = got < 0 ? errno : 0;
+    if (error == EAGAIN) {
+      error = awaitOutput(left);
+    } else if (isDirect && (error == EINVAL || error == ENOSYS || error == EPERM)) {
       canSplice = false;  // a file system, or a service manager's filter, without it
-      continue;
-    }
-    if (got < 0) return errno;
-    if (got == 0) return to.isComplete() ? 0 : EPIPE;
-    if (isDirect) {
+      error = 0;
+    } else if (error == EINTR) {
+      error = 0;
+    } else if (got == 0) {
+      return to.isComplete() ? 0 : EPIPE;
+    } else if (got > 0 && isDirect) {
       to.wentDirectly(static_cast<std::size_t>(got));
-    } else if (const int error = to.take({buffer.get(), static_cast<std::size_t>(got)}); error != 0) {
-      return error;
+    } else if (got > 0) {
+      error = to.take({buffer.get(), static_cast<std::size_t>(got)});
     }
+    if (error != 0) return error;
   }
 }
 

@@ -51,6 +51,8 @@ class ReaderProcess {
   int drain(std::chrono::steady_clock::time_point deadline, ReaderOutput& to);
 
  private:
+  int awaitOutput(std::chrono::milliseconds patience) const noexcept;
+
   pid_t pid_ = -1;
   UniqueFd output_;
 };

@@ -58,35 +58,45 @@ class RemovingWalk final : private TreeWalk {
 
 // The slow way, for when there is no memory: on the stack, a directory after the other, to a depth that a
 // carrier bundle never has.
-constexpr int kDeepestWithoutMemory = 64;
-constexpr int kMostRounds = 16;
+constexpr int kMaxDepthWithoutMemory = 64;
+constexpr int kMaxRounds = 16;
+
+int removeWithoutMemory(int above, const char* name, int depth) noexcept;
+
+// Removes what the directory holds, as far as one listing shows it. *first: the first failure, if there was
+// none before. Returns whether anything went.
+bool removeListed(int directory, int depth, int* first) noexcept {
+  bool isChanged = false;
+  alignas(dirent64) std::array<char, 1024> entries;
+  for (ssize_t size = 0; (size = ::getdents64(directory, entries.data(), entries.size())) > 0;) {
+    for (ssize_t at = 0; at < size;) {
+      const auto* const entry = reinterpret_cast<const dirent64*>(entries.data() + at);
+      at += entry->d_reclen;
+      const std::string_view one = entry->d_name;
+      if (one == "." || one == "..") continue;
+      const int error = removeWithoutMemory(directory, entry->d_name, depth + 1);
+      if (error == 0) isChanged = true;
+      if (*first == 0) *first = error;
+    }
+  }
+  return isChanged;
+}
 
 int removeWithoutMemory(int above, const char* name, int depth) noexcept {
   if (::unlinkat(above, name, 0) == 0) return 0;
   if (errno != EISDIR && errno != EPERM) return errno == ENOENT ? 0 : errno;
   const UniqueFd directory(::openat(above, name, kOpenFlags));
-  if (!directory.isValid() || depth == kDeepestWithoutMemory) {
+  if (!directory.isValid() || depth == kMaxDepthWithoutMemory) {
     const int error = directory.isValid() ? ENOMEM : errno;
     return ::unlinkat(above, name, AT_REMOVEDIR) == 0 ? 0 : error;
   }
   int first = 0;
-  alignas(dirent64) std::array<char, 1024> entries;
   // What is removed while it is listed may hide what follows it from the listing; and somebody may add more.
   bool isChanged = true;
-  for (int round = 0; round < kMostRounds && std::exchange(isChanged, false); ++round) {
+  for (int round = 0; round < kMaxRounds && isChanged; ++round) {
     first = 0;
     if (::lseek(directory.get(), 0, SEEK_SET) != 0) return errno;
-    for (ssize_t size = 0; (size = ::getdents64(directory.get(), entries.data(), entries.size())) > 0;) {
-      for (ssize_t at = 0; at < size;) {
-        const auto* const entry = reinterpret_cast<const dirent64*>(entries.data() + at);
-        at += entry->d_reclen;
-        const std::string_view one = entry->d_name;
-        if (one == "." || one == "..") continue;
-        const int error = removeWithoutMemory(directory.get(), entry->d_name, depth + 1);
-        if (error == 0) isChanged = true;
-        if (first == 0) first = error;
-      }
-    }
+    isChanged = removeListed(directory.get(), depth, &first);
   }
   if (::unlinkat(above, name, AT_REMOVEDIR) == 0) return 0;
   return first != 0 ? first : errno;

@@ -13,6 +13,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "platform/base/WriteAll.h"
 #include "platform/files/archive/ArchiveEntryPath.h"
 #include "platform/files/archive/ResourceCompanion.h"
 #include "platform/files/linux/FileContents.h"
@@ -28,7 +29,7 @@ constexpr std::size_t kCompanionHead = 64 << 10;
 constexpr std::uint64_t kWorthReserving = 1 << 20;
 constexpr mode_t kOwnerMayAdd = 0300;
 // As many paths of directories as are kept; more than that no bundle has.
-constexpr std::size_t kMostClosed = 1000;
+constexpr std::size_t kMaxClosedDirectories = 1000;
 
 // The same step by step, for a service manager's filter against set-id files: it cannot look into the
 // arguments of openat2(2) and refuses the call whole, or for one that is older than the call. Nothing else
@@ -74,7 +75,7 @@ UnpackWriter::UnpackWriter(int top, UnpackOptions options, std::uint64_t mostByt
                            std::function<int(const ArchiveFileError&)> onFileError)
     : top_(top),
       options_(options),
-      mostBytes_(std::min(mostBytes, kMostBytes)),
+      mostBytes_(std::min(mostBytes, kMaxBytes)),
       onFileError_(std::move(onFileError)),
       umask_(umaskIn(top)) {}
 
@@ -86,7 +87,7 @@ int UnpackWriter::fileError(const std::string& path, int code) {
 }
 
 int UnpackWriter::refuseEntry(const std::string& path, int code) {
-  if (++entries_ > kMostEntries) return EFBIG;
+  if (++entries_ > kMaxEntries) return EFBIG;
   return fileError(path, code);
 }
 
@@ -139,7 +140,7 @@ int UnpackWriter::start(const ArchiveEntry& entry) {
   if (entry.kind == Kind::link && !staysInside(entry.path, entry.target)) return EPERM;
   if (entry.kind == Kind::directory) {
     if (const int error = openParent(entry.path); error != 0) return error;
-    if ((entry.mode & kOwnerMayAdd) == kOwnerMayAdd || closed_.size() >= kMostClosed) {
+    if ((entry.mode & kOwnerMayAdd) == kOwnerMayAdd || closed_.size() >= kMaxClosedDirectories) {
       return setDirectoryMode(entry.path, entry.mode);
     }
     closed_[entry.path] = entry.mode;
@@ -156,7 +157,7 @@ int UnpackWriter::start(const ArchiveEntry& entry) {
 }
 
 int UnpackWriter::beginEntry(const ArchiveEntry& entry) {
-  if (++entries_ > kMostEntries) return EFBIG;
+  if (++entries_ > kMaxEntries) return EFBIG;
   skipping_ = false;
   written_ = 0;
   companionHead_.clear();

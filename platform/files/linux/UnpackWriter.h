@@ -24,8 +24,8 @@ struct UnpackOptions {
 // may throw std::bad_alloc.
 class UnpackWriter final : public ArchiveFrameSink {
  public:
-  static constexpr std::uint64_t kMostEntries = 100'000;
-  static constexpr std::uint64_t kMostBytes = std::uint64_t{1} << 30;
+  static constexpr std::uint64_t kMaxEntries = 100'000;
+  static constexpr std::uint64_t kMaxBytes = std::uint64_t{1} << 30;
 
   // `top` outlives the object. `mostBytes`: of all files together. `onFileError` answers as ArchiveCopier
   // says.

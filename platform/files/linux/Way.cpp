@@ -9,13 +9,14 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <array>
 #include <cerrno>
 #include <string_view>
 
 namespace brenvik {
 namespace {
 
-constexpr int kMostLinks = 40;  // as the kernel follows on one way
+constexpr int kMaxLinks = 40;  // the kernel's limit for one path
 
 bool isOwn(const struct stat& info) { return info.st_uid == 0 || info.st_uid == ::geteuid(); }
 
@@ -42,6 +43,14 @@ bool isFollowed(int directory, const struct stat& link, std::string_view target,
   return links == Links::own && (target.front() == '/' || !leadsUp(target));
 }
 
+// Takes the first name off the path; empty when only slashes are left.
+std::string takeName(std::string* path) {
+  path->erase(0, path->find_first_not_of('/'));
+  std::string name = path->substr(0, path->find('/'));
+  path->erase(0, name.size());
+  return name;
+}
+
 }  // namespace
 
 int openDirectory(const std::string& path, UniqueFd* directory, Links links) {
@@ -53,26 +62,24 @@ int openDirectory(const std::string& path, UniqueFd* directory, Links links) {
   int followed = 0;
   UniqueFd at(::open(rest.front() == '/' ? "/" : ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
   while (at.isValid()) {
-    rest.erase(0, rest.find_first_not_of('/'));
-    if (rest.empty()) {
+    const std::string name = takeName(&rest);
+    if (name.empty()) {
       *directory = std::move(at);
       return 0;
     }
-    const std::string name = rest.substr(0, rest.find('/'));
-    rest.erase(0, name.size());
     UniqueFd next(::openat(at.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
     struct stat info {};
     if (!next.isValid() || ::fstat(next.get(), &info) != 0) return errno;
-    if (!S_ISLNK(info.st_mode)) {
-      if (!S_ISDIR(info.st_mode)) return ENOTDIR;
+    if (S_ISDIR(info.st_mode)) {
       at = std::move(next);
       continue;
     }
-    if (++followed > kMostLinks) return ELOOP;
-    char text[PATH_MAX];
-    const ssize_t length = ::readlinkat(next.get(), "", text, sizeof text);
+    if (!S_ISLNK(info.st_mode)) return ENOTDIR;
+    if (++followed > kMaxLinks) return ELOOP;
+    std::array<char, PATH_MAX> text;
+    const ssize_t length = ::readlinkat(next.get(), "", text.data(), text.size());
     if (length <= 0) return length < 0 ? errno : ENOENT;
-    const std::string_view target(text, static_cast<std::size_t>(length));
+    const std::string_view target(text.data(), static_cast<std::size_t>(length));
     if (!isFollowed(at.get(), info, target, links)) return ENOENT;
     rest.insert(0, std::string(target) + "/");
     if (target.front() == '/') at.reset(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));

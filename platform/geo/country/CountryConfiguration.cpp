@@ -21,7 +21,7 @@ namespace {
 // Both files are small; what is larger is something else.
 constexpr std::size_t kLargestFile = std::size_t{64} << 10;
 // A link of local time leads to a zone, or by way of an alias or two.
-constexpr int kMostLinks = 8;
+constexpr int kMaxLinks = 8;
 
 // The content of a regular file of moderate size, and what fstat(2) says of it.
 std::optional<std::string> readFile(const std::string& path, struct stat* status) {
@@ -135,7 +135,7 @@ std::optional<std::string> CountryConfiguration::countryOfTimeZone() {
   std::optional<std::string> country;
   // Step by step: zones of two countries may be links to one file, and the first name is the one that was
   // chosen.
-  for (int links = 0; target && links < kMostLinks && !country; ++links) {
+  for (int links = 0; target && links < kMaxLinks && !country; ++links) {
     path = target->starts_with('/') ? *target : path.substr(0, path.rfind('/') + 1) + *target;
     // A relative alias climbs within the database: its name is what is left of the detour.
     path = std::filesystem::path(path).lexically_normal();

@@ -212,7 +212,7 @@ bool Gazetteer::open(std::string& error) {
 
 // Countries, layers and rules are few, and every look-up needs them.
 bool Gazetteer::readTables() {
-  constexpr std::size_t kMost = 4096;  // of each: what has more is no gazetteer
+  constexpr std::size_t kMaxRows = 4096;  // of each: what has more is no gazetteer
   const auto readAll = [this](const char* sql, const auto& take) {
     Query rows(*sqlite(), opened_->database.get(), sql);
     if (!rows.isValid()) {
@@ -222,7 +222,8 @@ bool Gazetteer::readTables() {
     int code = rows.step();
     std::size_t count = 1;
     for (; code == SQLITE_ROW; code = rows.step(), ++count) {
-      if (count > kMost || rows.integer(0) != static_cast<std::int64_t>(count) || !take(rows)) return false;
+      if (count > kMaxRows || rows.integer(0) != static_cast<std::int64_t>(count) || !take(rows))
+        return false;
     }
     finish(rows, code);
     return !failure_ && count > 1;

@@ -67,7 +67,7 @@ void PublicAddressFinder::find(Deliver deliver) {
 }
 
 void PublicAddressFinder::stop() noexcept {
-  std::array<Worker, kMostTransactions> workers;
+  std::array<Worker, kMaxTransactions> workers;
   {
     const std::lock_guard lock(mutex_);
     stopped_ = true;

@@ -15,13 +15,13 @@
 namespace brenvik {
 
 // Finds the address under which this device is seen from outside. Each question has a STUN transaction of its
-// own, which begins at once, on a queue of its own. Where there are kMostTransactions already, or no thread
+// own, which begins at once, on a queue of its own. Where there are kMaxTransactions already, or no thread
 // for another one, a question shares the transaction that began last.
 class PublicAddressFinder : public std::enable_shared_from_this<PublicAddressFinder> {
  public:
   // A transaction takes eight seconds at most, and a usual one a fraction of one: more come from a caller
   // that floods, and need not become a flood of datagrams.
-  static constexpr std::size_t kMostTransactions = 4;
+  static constexpr std::size_t kMaxTransactions = 4;
 
   // Called on a queue of the finder's.
   using Deliver = std::function<void(const StunOutcome&)>;
@@ -29,7 +29,7 @@ class PublicAddressFinder : public std::enable_shared_from_this<PublicAddressFin
   // thread.
   using MakeNetwork = std::function<std::unique_ptr<StunNetwork>(int stopFd)>;
 
-  // The queues outlive it, or its stop(). Throws OutOfQueues, here for want of a descriptor.
+  // The queues outlive it, or its stop(). Throws OutOfQueues when no descriptor is left.
   PublicAddressFinder(MakeNetwork makeNetwork, WorkQueues& queues);
 
   // Any thread. An error where there is no thread at all; that comes from within the call.
@@ -58,7 +58,7 @@ class PublicAddressFinder : public std::enable_shared_from_this<PublicAddressFin
   std::mutex mutex_;                                   // guards the rest
   std::vector<std::unique_ptr<Transaction>> running_;  // in the order they began
   bool stopped_ = false;
-  std::array<Worker, kMostTransactions> workers_;  // made as they are needed, and kept
+  std::array<Worker, kMaxTransactions> workers_;  // made as they are needed, and kept
 };
 
 }  // namespace brenvik

@@ -16,7 +16,7 @@ namespace brenvik {
 // SQLite's. It must not outlive its database.
 class Query {
  public:
-  // Makes a statement ready to run again when the scope is left, by an exception, too.
+  // Resets a statement at the end of the scope, also when an exception ends it.
   class Run {
    public:
     explicit Run(Query& query) noexcept : query_(query) {}

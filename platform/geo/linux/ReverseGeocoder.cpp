@@ -27,7 +27,7 @@ std::string decimal(double degrees) {
 
 // What the parts of an address may take together in a push to the telephony daemon: a datagram of 65,536
 // bytes holds them beside the message and the keys, with some room to spare.
-constexpr std::size_t kMostOfAPush = 65'000;
+constexpr std::size_t kMaxPushBytes = 65'000;
 
 // In a binary property list: a byte a character, or UTF-16 for all of a text that is not ASCII.
 std::size_t sizeInAPush(const std::string& text) {
@@ -49,7 +49,7 @@ void fitIntoAPush(StructuredAddress& address) {
        {&address.countryCode, &address.postCode, &address.locality, &address.administrativeArea}) {
     if (!*part) continue;
     const std::size_t size = sizeInAPush(**part);
-    if (size > kMostOfAPush - taken) {
+    if (size > kMaxPushBytes - taken) {
       part->reset();
     } else {
       taken += size;

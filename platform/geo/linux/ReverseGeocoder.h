@@ -21,7 +21,7 @@ inline constexpr std::chrono::seconds kGeocoderPatience{10};
 // Between two requests. One second is what public servers ask of their users; a server of one's own may need
 // none.
 inline constexpr std::chrono::milliseconds kGeocoderPace{BRENVIK_GEOCODER_PACE};
-// Longer than this nobody waits for his turn: the offline gazetteer answers instead.
+// The longest that a request waits for its turn; after that the offline gazetteer answers.
 inline constexpr std::chrono::seconds kLongestTurn{4};
 
 // Finds the address at a coordinate: a Nominatim-compatible server, if there is one, and the offline

@@ -292,10 +292,10 @@ TEST_F(PublicAddressFinderTest, OfAFloodOfQuestionsTheLaterOnesShareATransaction
   for (int i = 0; i < 100; ++i) ask(*finder);
   go.set_value();
   EXPECT_TRUE(haveCome(100));
-  EXPECT_EQ(transactions, static_cast<int>(PublicAddressFinder::kMostTransactions));
+  EXPECT_EQ(transactions, static_cast<int>(PublicAddressFinder::kMaxTransactions));
   ask(*finder);
   EXPECT_TRUE(haveCome(101));
-  EXPECT_EQ(transactions, static_cast<int>(PublicAddressFinder::kMostTransactions) + 1) << "nothing is kept";
+  EXPECT_EQ(transactions, static_cast<int>(PublicAddressFinder::kMaxTransactions) + 1) << "nothing is kept";
   finder->stop();
 }
 
@@ -404,7 +404,7 @@ TEST_F(PublicAddressFinderTest, WhereThereIsNoThreadForAnotherTransactionTheLast
 }
 
 TEST_F(PublicAddressFinderTest, WithoutDescriptorsTheReserveHoldsItsTransactionsBesideEveryOtherQueue) {
-  untilAllRun = static_cast<int>(PublicAddressFinder::kMostTransactions);
+  untilAllRun = static_cast<int>(PublicAddressFinder::kMaxTransactions);
   const auto finder = make(queues);
   rlimit before{};
   ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);

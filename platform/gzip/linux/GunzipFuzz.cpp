@@ -14,14 +14,14 @@ using namespace brenvik;
 
 namespace {
 
-constexpr std::size_t kLargest = 20'000;
+constexpr std::size_t kMaxSize = 20'000;
 
 // The plain way: each member at once into memory. Nothing when it is not whole or too large.
 std::optional<std::string> atOnce(const std::uint8_t* data, std::size_t size) {
   std::string output;
   if (size == 0) return std::nullopt;
   while (size > 0) {
-    static std::array<char, kLargest + 1> member;
+    static std::array<char, kMaxSize + 1> member;
     z_stream stream{};
     if (::inflateInit2(&stream, 15 + 16) != Z_OK) return std::nullopt;
     stream.next_in = const_cast<Bytef*>(data);
@@ -33,7 +33,7 @@ std::optional<std::string> atOnce(const std::uint8_t* data, std::size_t size) {
     data += stream.total_in;
     size -= stream.total_in;
     ::inflateEnd(&stream);
-    if (result != Z_STREAM_END || output.size() > kLargest) return std::nullopt;
+    if (result != Z_STREAM_END || output.size() > kMaxSize) return std::nullopt;
   }
   return output;
 }
@@ -48,8 +48,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     output.append(reinterpret_cast<const char*>(piece.data()), piece.size());
     return true;
   };
-  const GunzipResult result = gunzip.gunzip(input, kLargest, take);
-  if (output.size() > kLargest) std::abort();
+  const GunzipResult result = gunzip.gunzip(input, kMaxSize, take);
+  if (output.size() > kMaxSize) std::abort();
   const auto expected = atOnce(data, size);
   if ((result == GunzipResult::whole) != expected.has_value()) std::abort();
   if (expected && *expected != output) std::abort();

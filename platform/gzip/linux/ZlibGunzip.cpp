@@ -2,14 +2,14 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/gzip/linux/ZlibGunzip.h"
 
-#include <unistd.h>
 #include <zlib.h>
 
 #include <algorithm>
-#include <cerrno>
 #include <limits>
 #include <memory>
 #include <new>
+
+#include "platform/base/WriteAll.h"
 
 namespace brenvik {
 namespace {
@@ -22,18 +22,6 @@ struct InflateEnd {
   void operator()(z_stream* stream) const noexcept { (void)::inflateEnd(stream); }
 };
 
-// 0, or the number of the error.
-int writeAll(int file, std::span<const std::byte> bytes) noexcept {
-  while (!bytes.empty()) {
-    const auto written = ::write(file, bytes.data(), bytes.size());
-    if (written < 0 && errno == EINTR) continue;
-    if (written < 0) return errno;
-    if (written == 0) return EIO;
-    bytes = bytes.subspan(static_cast<std::size_t>(written));
-  }
-  return 0;
-}
-
 uInt clamped(std::size_t size) noexcept {
   return static_cast<uInt>(std::min<std::size_t>(size, std::numeric_limits<uInt>::max()));
 }
@@ -41,7 +29,7 @@ uInt clamped(std::size_t size) noexcept {
 }  // namespace
 
 GunzipResult ZlibGunzip::gunzip(std::span<const std::byte> input, std::uint64_t largestOutput,
-                                const Receiver& receiver) noexcept try {
+                                const Receiver& receiver) {
   z_stream stream{};
   if (::inflateInit2(&stream, kGzipWrapper) != Z_OK) return GunzipResult::outOfMemory;
   const std::unique_ptr<z_stream, InflateEnd> owned(&stream);
@@ -72,8 +60,6 @@ GunzipResult ZlibGunzip::gunzip(std::span<const std::byte> input, std::uint64_t 
       return GunzipResult::truncated;
     }
   }
-} catch (...) {
-  return GunzipResult::outOfMemory;
 }
 
 GunzipOutcome ZlibGunzip::gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
@@ -91,7 +77,7 @@ GunzipOutcome ZlibGunzip::gunzipInto(const GunzipInput& input, int file, std::ui
     return outcome.writeError == 0 && (!mayGoOn || mayGoOn());
   });
   return outcome;
-} catch (...) {
+} catch (const std::bad_alloc&) {
   return {GunzipResult::outOfMemory, 0, 0};
 }
 

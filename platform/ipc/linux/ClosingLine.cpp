@@ -21,7 +21,7 @@ namespace brenvik {
 namespace {
 
 // One account keeps one thread at most, so this many accounts must work together to hold up the others.
-constexpr std::size_t kMostThreads = 4;
+constexpr std::size_t kMaxThreads = 4;
 
 // Enough for closing, and for what a sanitizer adds.
 constexpr std::size_t kStackBytes = 256 * 1024;
@@ -86,7 +86,7 @@ struct ClosingLine::State {
 
   // Whether more accounts have jobs than threads wait for them.
   bool needsThread() const noexcept {
-    std::array<Account, kMostThreads> seen{};
+    std::array<Account, kMaxThreads> seen{};
     std::size_t count = 0;
     for (const Job& job : jobs) {
       if (isBusy(job.account) ||
@@ -123,8 +123,8 @@ bool ClosingLine::State::push(Job&& job) noexcept {
   const std::lock_guard lock(mutex);
   if (stopping || jobs.size() >= capacity) return false;
   try {
-    busy.reserve(kMostThreads);
-    if (job.token != 0) discarded.reserve(capacity + kMostThreads);  // telling must not fail
+    busy.reserve(kMaxThreads);
+    if (job.token != 0) discarded.reserve(capacity + kMaxThreads);  // telling must not fail
     jobs.push_back(std::move(job));
   } catch (const std::bad_alloc&) {
     return false;
@@ -136,7 +136,7 @@ bool ClosingLine::State::push(Job&& job) noexcept {
 void ClosingLine::State::startThread(const std::shared_ptr<State>& self) noexcept {
   {
     const std::lock_guard lock(mutex);
-    if (threads == kMostThreads || !needsThread()) return;
+    if (threads == kMaxThreads || !needsThread()) return;
     if (threads == 0) {
       struct sigaction action {};
       action.sa_handler = interrupt;

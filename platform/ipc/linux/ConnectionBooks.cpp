@@ -33,14 +33,14 @@ void ConnectionBooks::remove(Entry& entry) noexcept {
 
 ConnectionBooks::Entry* ConnectionBooks::overdueAfter(const Entry& entry) const noexcept {
   const auto account = accounts_.find(entry.account_);
-  if (account != accounts_.end() && account->second.size() > kMostStrangersOfOneAccount) {
+  if (account != accounts_.end() && account->second.size() > kMaxStrangersPerAccount) {
     return account->second.front();
   }
-  return strangers_.size() > kMostStrangers ? strangers_.front() : nullptr;
+  return strangers_.size() > kMaxStrangers ? strangers_.front() : nullptr;
 }
 
 ConnectionBooks::Entry* ConnectionBooks::overdueAdmitted() const noexcept {
-  return admitted_.size() > kMostAdmitted ? admitted_.front() : nullptr;
+  return admitted_.size() > kMaxAdmitted ? admitted_.front() : nullptr;
 }
 
 }  // namespace brenvik

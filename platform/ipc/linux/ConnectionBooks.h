@@ -16,10 +16,10 @@ class ConnectionBooks {
  public:
   // A client sends its check-in at once, so few connections are ever waiting. What one account may hold is
   // below the total, so that it cannot crowd out the others.
-  static constexpr std::size_t kMostStrangers = 128;
-  static constexpr std::size_t kMostStrangersOfOneAccount = 64;
+  static constexpr std::size_t kMaxStrangers = 128;
+  static constexpr std::size_t kMaxStrangersPerAccount = 64;
   // A client that has checked in needs its connection only to check in once more.
-  static constexpr std::size_t kMostAdmitted = 32;
+  static constexpr std::size_t kMaxAdmitted = 32;
 
   // What a connection is derived from. It is struck out before it is destroyed.
   class Entry {

@@ -9,8 +9,8 @@
 namespace brenvik {
 namespace {
 
-constexpr std::size_t kOfOne = ConnectionBooks::kMostStrangersOfOneAccount;
-constexpr std::size_t kInAll = ConnectionBooks::kMostStrangers;
+constexpr std::size_t kOfOne = ConnectionBooks::kMaxStrangersPerAccount;
+constexpr std::size_t kInAll = ConnectionBooks::kMaxStrangers;
 
 class ConnectionBooksTest : public testing::Test {
  protected:
@@ -54,7 +54,7 @@ TEST_F(ConnectionBooksTest, WhoHasCheckedInIsNoStrangerAnyMore) {
 }
 
 TEST_F(ConnectionBooksTest, OfTheConnectionsOfClientsTheOldestMayGo) {
-  for (std::size_t i = 0; i < ConnectionBooks::kMostAdmitted; ++i) {
+  for (std::size_t i = 0; i < ConnectionBooks::kMaxAdmitted; ++i) {
     books.admit(add(1));
     EXPECT_EQ(books.overdueAdmitted(), nullptr);
   }

@@ -67,7 +67,7 @@ class IncomingMessage {
   static constexpr std::size_t kControlRoom = CMSG_SPACE(sizeof(int) * 253) + CMSG_SPACE(sizeof(ucred));
   // For one right: CMSG_SPACE would leave room for two.
   static constexpr std::size_t kControlRoomOfAStranger = CMSG_SPACE(sizeof(ucred)) + CMSG_LEN(sizeof(int));
-  static constexpr std::size_t kMostRights = (kControlRoom - CMSG_LEN(0)) / sizeof(int);  // that fit in there
+  static constexpr std::size_t kMaxRights = (kControlRoom - CMSG_LEN(0)) / sizeof(int);  // that fit in there
 
   struct Mapping {
     void* address;
@@ -91,15 +91,15 @@ class IncomingMessage {
   std::size_t fdCount_ = 0;
   std::size_t mappingCount_ = 0;
   std::size_t nameCount_ = 0;
-  std::array<UniqueFd, kMostRights> fds_;
-  std::array<PortName, kMostRights> names_;
+  std::array<UniqueFd, kMaxRights> fds_;
+  std::array<PortName, kMaxRights> names_;
   // The control data first: it shares the pages of the above. The mappings last: a check-in has none.
   struct Storage {
     alignas(cmsghdr) std::array<char, kControlRoom> control;
     alignas(16) std::array<std::byte, kLargestDatagram> bytes;
   };
   Storage storage_;
-  std::array<Mapping, kMostRights> mappings_;
+  std::array<Mapping, kMaxRights> mappings_;
 };
 
 }  // namespace brenvik

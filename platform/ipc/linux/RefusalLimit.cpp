@@ -13,9 +13,9 @@ bool RefusalLimit::allows(uid_t account, Time now) const noexcept {
 }
 
 void RefusalLimit::refused(uid_t account, Time now) noexcept {
-  if (paidUntil_.size() >= kMostAccounts) {
+  if (paidUntil_.size() >= kMaxAccounts) {
     std::erase_if(paidUntil_, [now](const auto& entry) { return entry.second <= now; });
-    if (paidUntil_.size() >= kMostAccounts) paidUntil_.erase(paidUntil_.begin());
+    if (paidUntil_.size() >= kMaxAccounts) paidUntil_.erase(paidUntil_.begin());
   }
   try {
     Time& paid = paidUntil_[account];

@@ -31,7 +31,7 @@ class RefusalLimit {
  private:
   // Accounts remembered: more than a machine has that may connect. Beyond it, those are forgotten that
   // have been quiet long enough.
-  static constexpr std::size_t kMostAccounts = 1024;
+  static constexpr std::size_t kMaxAccounts = 1024;
 
   // When the last refusal will have been paid for, at one in kOneMoreEvery.
   std::unordered_map<uid_t, Time> paidUntil_;

@@ -41,7 +41,7 @@ constexpr std::chrono::milliseconds kTick = RefusalLimit::kOneMoreEvery;
 
 // A reply for which the kernel has no memory is tried again, about a second in all.
 constexpr std::chrono::milliseconds kRetryPause{10};
-constexpr int kMostRetries = 100;
+constexpr int kMaxRetries = 100;
 
 constexpr std::size_t kLargestReply = 512;
 static_assert(kLargestReply >= kRequestLargestReply && kLargestReply >= kCheckInLargestMessage);
@@ -389,7 +389,7 @@ void Channel::answer(OutgoingReply& reply, bool wanted) noexcept {
     finish(reply);
     return end();
   }
-  retriesLeft_ = kMostRetries;
+  retriesLeft_ = kMaxRetries;
   pending_.reset(new (std::nothrow) OutgoingReply(std::move(reply)));
   if (pending_ == nullptr || !waitToSend(sent)) {
     if (pending_ == nullptr) finish(reply);

@@ -3,7 +3,6 @@
 #include "platform/labeler/linux/CatalogueLabeler.h"
 
 #include <array>
-#include <new>
 #include <optional>
 #include <utility>
 #include <vector>
@@ -41,28 +40,24 @@ std::optional<Label> labelOf(std::string_view text) noexcept {
 
 // Calls `make` with each label that is a text and gathers what it returns; no value as soon as that is none.
 template <class Make>
-PropertyList textsFor(const PropertyList& labels, const Make& make) noexcept {
-  try {
-    std::vector<PropertyList> texts;
-    texts.reserve(labels.size());
-    for (std::size_t i = 0; i < labels.size(); ++i) {
-      const PropertyList label = labels.at(i);
-      const std::optional<std::string_view> text = label.asString();
-      if (!text.has_value()) continue;
-      PropertyList made = make(label, *text);
-      if (!made.hasValue()) return {};
-      texts.push_back(std::move(made));
-    }
-    return PropertyList::array(std::move(texts));
-  } catch (const std::bad_alloc&) {
-    return {};
+PropertyList textsFor(const PropertyList& labels, const Make& make) {
+  std::vector<PropertyList> texts;
+  texts.reserve(labels.size());
+  for (std::size_t i = 0; i < labels.size(); ++i) {
+    const PropertyList label = labels.at(i);
+    const std::optional<std::string_view> text = label.asString();
+    if (!text.has_value()) continue;
+    PropertyList made = make(label, *text);
+    if (!made.hasValue()) return {};
+    texts.push_back(std::move(made));
   }
+  return PropertyList::array(std::move(texts));
 }
 
 }  // namespace
 
 PropertyList CatalogueLabeler::localizedBadgeLabels(const PropertyList& labels,
-                                                    const PropertyList& languages) noexcept {
+                                                    const PropertyList& languages) {
   const LabelCatalogue catalogue = catalogueFor(languages);
   Badges badges(catalogue.language());
   return textsFor(labels, [&](const PropertyList&, std::string_view text) {
@@ -72,8 +67,7 @@ PropertyList CatalogueLabeler::localizedBadgeLabels(const PropertyList& labels,
   });
 }
 
-PropertyList CatalogueLabeler::localizedLabels(const PropertyList& labels,
-                                               const PropertyList& languages) noexcept {
+PropertyList CatalogueLabeler::localizedLabels(const PropertyList& labels, const PropertyList& languages) {
   const LabelCatalogue catalogue = catalogueFor(languages);
   std::array<PropertyList, kLabelCount> names;  // one value for all labels alike, however many a client sends
   return textsFor(labels, [&](const PropertyList& label, std::string_view text) {

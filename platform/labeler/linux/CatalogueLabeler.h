@@ -9,9 +9,8 @@ namespace brenvik {
 // The labeler on the catalogues compiled into the program. It has no state: making one costs nothing.
 class CatalogueLabeler final : public SubscriptionLabeler {
  public:
-  PropertyList localizedBadgeLabels(const PropertyList& labels,
-                                    const PropertyList& languages) noexcept override;
-  PropertyList localizedLabels(const PropertyList& labels, const PropertyList& languages) noexcept override;
+  PropertyList localizedBadgeLabels(const PropertyList& labels, const PropertyList& languages) override;
+  PropertyList localizedLabels(const PropertyList& labels, const PropertyList& languages) override;
 };
 
 }  // namespace brenvik

@@ -12,6 +12,7 @@
 #include <cstdlib>
 #include <memory>
 #include <new>
+#include <span>
 
 namespace brenvik {
 namespace {
@@ -95,6 +96,31 @@ bool casedFollows(const ucs4_t* text, std::size_t size, std::size_t from) noexce
   return from < size && isCased(text[from]);
 }
 
+// The marks that follow a Greek letter in decomposed text.
+struct GreekMarks {
+  bool accent = false;
+  bool dialytika = false;
+  std::size_t ypogegrammenis = 0;
+};
+
+// *next: the character after the letter; afterwards the one after its marks.
+GreekMarks takeGreekMarks(std::span<const ucs4_t> text, std::size_t* next) noexcept {
+  GreekMarks marks;
+  for (; *next < text.size(); ++*next) {
+    const ucs4_t mark = text[*next];
+    if (mark == kDialytika) {
+      marks.dialytika = true;
+    } else if (mark == kYpogegrammeni) {
+      ++marks.ypogegrammenis;
+    } else if (isAccent(mark)) {
+      marks.accent = true;
+    } else if (!isOtherMark(mark)) {
+      break;
+    }
+  }
+  return marks;
+}
+
 // Greek capitals carry no accents: "ά" becomes "Α". What the accent said is kept where it matters: a vowel
 // pair it kept apart gets a dialytika ("μάιος", "ΜΑΪΟΣ"), and the word "ή" (or) keeps it.
 std::string greekWithoutAccents(std::string_view text) {
@@ -120,29 +146,14 @@ std::string greekWithoutAccents(std::string_view text) {
       continue;
     }
     const ucs4_t capital = uc_toupper(c);
-    bool accent = false;
-    bool dialytika = accentRemoved && (capital == 0x0399 || capital == 0x03A5);
-    std::size_t ypogegrammenis = 0;
-    for (; i < size; ++i) {
-      const ucs4_t mark = decomposed.get()[i];
-      if (mark == kDialytika) {
-        dialytika = true;
-      } else if (mark == kYpogegrammeni) {
-        ++ypogegrammenis;
-      } else if (isAccent(mark)) {
-        accent = true;
-      } else if (!isOtherMark(mark)) {
-        break;
-      }
-    }
-    accentRemoved = accent && !dialytika && isGreekVowel(capital);
+    GreekMarks marks = takeGreekMarks(std::span(decomposed.get(), size), &i);
+    if (accentRemoved && (capital == 0x0399 || capital == 0x03A5)) marks.dialytika = true;
+    accentRemoved = marks.accent && !marks.dialytika && isGreekVowel(capital);
     append(result, capital);
-    if (dialytika) append(result, kDialytika);
-    if (capital == 0x0397 && accent && ypogegrammenis == 0 && !casedBefore &&
-        !casedFollows(decomposed.get(), size, i)) {
-      append(result, kTonos);
-    }
-    for (; ypogegrammenis > 0; --ypogegrammenis) append(result, kYpogegrammeni);
+    if (marks.dialytika) append(result, kDialytika);
+    const bool isLoneEta = capital == 0x0397 && marks.ypogegrammenis == 0 && !casedBefore;
+    if (isLoneEta && marks.accent && !casedFollows(decomposed.get(), size, i)) append(result, kTonos);
+    for (; marks.ypogegrammenis > 0; --marks.ypogegrammenis) append(result, kYpogegrammeni);
   }
   return result;
 }

@@ -56,7 +56,7 @@ void EscapedLine::escape(std::string_view bytes) noexcept {
 
 // A line that is longer than any is cut, between two characters.
 void EscapedLine::append(std::string_view bytes) noexcept {
-  if (bytes.size() > kLongest - size_) return;
+  if (bytes.size() > kMaxLength - size_) return;
   std::memcpy(text_.data() + size_, bytes.data(), bytes.size());
   size_ += bytes.size();
 }

@@ -24,12 +24,12 @@ class EscapedLine {
 
  private:
   // The longest line of the log, with all of it escaped.
-  static constexpr std::size_t kLongest = 4 * 4096;
+  static constexpr std::size_t kMaxLength = 4 * 4096;
 
   void escape(std::string_view bytes) noexcept;
   void append(std::string_view bytes) noexcept;
 
-  std::array<char, kLongest + 1> text_;
+  std::array<char, kMaxLength + 1> text_;
   std::size_t size_ = 0;
 };
 

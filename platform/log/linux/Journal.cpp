@@ -15,6 +15,7 @@
 #include <cstring>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/base/WriteAll.h"
 
 namespace brenvik {
 namespace {
@@ -29,7 +30,7 @@ iovec io(std::string_view bytes) noexcept { return {const_cast<char*>(bytes.data
 class Entry {
  public:
   explicit Entry(std::span<const JournalField> fields) noexcept {
-    for (const JournalField& field : fields.first(std::min(fields.size(), Journal::kMostFields))) add(field);
+    for (const JournalField& field : fields.first(std::min(fields.size(), Journal::kMaxFields))) add(field);
   }
   std::span<iovec> bytes() noexcept { return {parts_.data(), count_}; }
 
@@ -51,30 +52,11 @@ class Entry {
   }
   void append(std::string_view bytes) noexcept { parts_[count_++] = io(bytes); }
 
-  std::array<iovec, 5 * Journal::kMostFields> parts_;
+  std::array<iovec, 5 * Journal::kMaxFields> parts_;
   std::size_t count_ = 0;
-  std::array<std::uint64_t, Journal::kMostFields> lengths_;
+  std::array<std::uint64_t, Journal::kMaxFields> lengths_;
   std::size_t lengthCount_ = 0;
 };
-
-// Writes everything to a file at its offset; `bytes` is used up.
-bool writeAll(int fd, std::span<iovec> bytes) noexcept {
-  while (!bytes.empty()) {
-    const ssize_t written = ::writev(fd, bytes.data(), static_cast<int>(bytes.size()));
-    if (written < 0 && errno == EINTR) continue;
-    if (written <= 0) return false;
-    auto left = static_cast<std::size_t>(written);
-    while (!bytes.empty() && left >= bytes.front().iov_len) {
-      left -= bytes.front().iov_len;
-      bytes = bytes.subspan(1);
-    }
-    if (left > 0) {
-      bytes.front().iov_base = static_cast<char*>(bytes.front().iov_base) + left;
-      bytes.front().iov_len -= left;
-    }
-  }
-  return true;
-}
 
 }  // namespace
 
@@ -127,7 +109,7 @@ bool Journal::send(msghdr& message) noexcept {
 bool Journal::sendInMemory(std::span<iovec> bytes) noexcept {
   const UniqueFd memory(::memfd_create("journal-entry", MFD_CLOEXEC | MFD_ALLOW_SEALING));
   constexpr int kSeals = F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE | F_SEAL_SEAL;
-  if (!memory.isValid() || !writeAll(memory.get(), bytes) ||
+  if (!memory.isValid() || writeAll(memory.get(), bytes) != 0 ||
       ::fcntl(memory.get(), F_ADD_SEALS, kSeals) != 0) {
     return false;
   }

@@ -22,7 +22,7 @@ struct JournalField {
 class Journal {
  public:
   static constexpr const char* kSocket = "/run/systemd/journal/socket";
-  static constexpr std::size_t kMostFields = 16;
+  static constexpr std::size_t kMaxFields = 16;
 
   // `path` is copied; it fits a socket address.
   explicit Journal(const char* path = kSocket) noexcept;

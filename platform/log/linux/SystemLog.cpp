@@ -27,9 +27,9 @@ constexpr std::string_view kJournalsSyslogSocket = "/run/systemd/journal/dev-log
 // Sends an entry of these fields, followed by those of the request that the line belongs to.
 template <std::size_t count>
 bool sendWithContext(Journal& journal, const std::array<JournalField, count>& own) noexcept {
-  static_assert(count + LogFields::kMost <= Journal::kMostFields);
+  static_assert(count + LogFields::kMaxFields <= Journal::kMaxFields);
   const LogFields context;
-  std::array<JournalField, count + LogFields::kMost> all;
+  std::array<JournalField, count + LogFields::kMaxFields> all;
   std::copy(own.begin(), own.end(), all.begin());
   std::size_t size = count;
   for (const LogFields::Field& each : context.all()) all[size++] = {each.key, each.value};

@@ -8,6 +8,7 @@
 #include <cstring>
 #include <deque>
 #include <memory>
+#include <new>
 #include <optional>
 #include <string>
 #include <utility>
@@ -31,7 +32,8 @@ class FakeEchoNetwork final : public EchoNetwork {
   std::optional<in_addr> hostAddress;
   std::optional<int> icmpNumber = 1;
   bool refuseSockets = false;
-  bool raw = false;  // sockets deliver the IP header
+  bool isWithoutMemory = false;  // when it is asked for a socket
+  bool raw = false;              // sockets deliver the IP header
   unsigned cellularIndex = 0;
   int timeOutError = 0;
   int sendError = 0;
@@ -57,7 +59,8 @@ class FakeEchoNetwork final : public EchoNetwork {
   std::optional<int> protocolByName(const char* name) noexcept override {
     return std::strcmp(name, "icmp") == 0 ? icmpNumber : std::nullopt;
   }
-  std::unique_ptr<EchoSocket> openEchoSocket(int protocol, std::uint16_t identifier) noexcept override {
+  std::unique_ptr<EchoSocket> openEchoSocket(int protocol, std::uint16_t identifier) override {
+    if (isWithoutMemory) throw std::bad_alloc();
     opened.emplace_back(protocol, identifier);
     if (refuseSockets) return nullptr;
     return std::make_unique<Socket>(*this);

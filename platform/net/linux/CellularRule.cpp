@@ -60,7 +60,7 @@ bool isCellularServer(const std::string& address, const CellularRuleFiles& files
   addrinfo* list = nullptr;
   if (::getaddrinfo(address.c_str(), nullptr, &hints, &list) != 0) return false;  // the resolver skips it too
   const std::unique_ptr<addrinfo, decltype(&::freeaddrinfo)> owned(list, ::freeaddrinfo);
-  const auto index = interfaceTowards(*list->ai_addr);
+  const auto index = interfaceTo(*list->ai_addr);
   return index && isCellular(*index, files);
 }
 
@@ -79,7 +79,7 @@ bool isCellularInterface(std::string_view name, const CellularRuleFiles& files) 
 }
 
 ConnectionWay routeTo(const sockaddr& peer, const CellularRuleFiles& files) noexcept try {
-  const auto index = interfaceTowards(peer);
+  const auto index = interfaceTo(peer);
   if (!index) return {};
   std::string name = nameOfInterface(*index);
   if (name.empty()) return {};

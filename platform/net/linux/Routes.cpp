@@ -69,37 +69,53 @@ RouteRequest makeRequest(std::uint16_t flags, std::uint8_t family) noexcept {
   return request;
 }
 
+// A socket that the kernel has the request on; invalid when it cannot be had.
+UniqueFd sent(const RouteRequest& request) noexcept {
+  UniqueFd fd(::socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_ROUTE));
+  if (!fd.isValid()) return {};
+  (void)::setsockopt(fd.get(), SOL_SOCKET, SO_RCVTIMEO, &kAnswerTimeOut, sizeof kAnswerTimeOut);
+  sockaddr_nl kernel{};
+  kernel.nl_family = AF_NETLINK;
+  if (::connect(fd.get(), reinterpret_cast<const sockaddr*>(&kernel), sizeof kernel) != 0) return {};
+  if (::send(fd.get(), &request, request.header.nlmsg_len, 0) < 0) return {};
+  return fd;
+}
+
+enum class Answer { goesOn, complete, failed };
+
+// Calls `visit(rtmsg, attributes)` for each route in a piece of the answer.
+template <typename Visit>
+Answer visitRoutes(std::span<const std::byte> piece, bool isDump, Visit& visit) {
+  while (const auto header = readAt<nlmsghdr>(piece)) {
+    if (header->nlmsg_len < sizeof(nlmsghdr) || header->nlmsg_len > piece.size()) return Answer::failed;
+    if (header->nlmsg_type == NLMSG_DONE) return Answer::complete;
+    if (header->nlmsg_type == NLMSG_ERROR) return Answer::failed;
+    const auto message = piece.subspan(sizeof(nlmsghdr), header->nlmsg_len - sizeof(nlmsghdr));
+    if (header->nlmsg_type == RTM_NEWROUTE) {
+      if (const auto route = readAt<rtmsg>(message)) visit(*route, message.subspan(aligned(sizeof(rtmsg))));
+      if (!isDump) return Answer::complete;
+    }
+    piece = piece.subspan(std::min(piece.size(), aligned(header->nlmsg_len)));
+  }
+  return Answer::goesOn;
+}
+
 // Sends the request and calls `visit(rtmsg, attributes)` for each route of the answer. False when the kernel
 // reported an error or did not answer.
 template <typename Visit>
 bool ask(const RouteRequest& request, Visit visit) {
-  const UniqueFd fd(::socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_ROUTE));
+  const UniqueFd fd = sent(request);
   if (!fd.isValid()) return false;
-  (void)::setsockopt(fd.get(), SOL_SOCKET, SO_RCVTIMEO, &kAnswerTimeOut, sizeof kAnswerTimeOut);
-  sockaddr_nl kernel{};
-  kernel.nl_family = AF_NETLINK;
-  if (::connect(fd.get(), reinterpret_cast<const sockaddr*>(&kernel), sizeof kernel) != 0) return false;
-  if (::send(fd.get(), &request, request.header.nlmsg_len, 0) < 0) return false;
-
-  const bool dump = (request.header.nlmsg_flags & NLM_F_DUMP) == NLM_F_DUMP;
+  const bool isDump = (request.header.nlmsg_flags & NLM_F_DUMP) == NLM_F_DUMP;
   std::vector<std::byte> buffer(kReceiveSize);
-  for (;;) {
+  for (auto answer = Answer::goesOn; answer != Answer::complete;) {
     const auto received = ::recv(fd.get(), buffer.data(), buffer.size(), 0);
     if (received < 0 && errno == EINTR) continue;
     if (received <= 0) return false;
-    std::span<const std::byte> rest(buffer.data(), static_cast<std::size_t>(received));
-    while (const auto header = readAt<nlmsghdr>(rest)) {
-      if (header->nlmsg_len < sizeof(nlmsghdr) || header->nlmsg_len > rest.size()) return false;
-      if (header->nlmsg_type == NLMSG_DONE) return true;
-      if (header->nlmsg_type == NLMSG_ERROR) return false;
-      const auto message = rest.subspan(sizeof(nlmsghdr), header->nlmsg_len - sizeof(nlmsghdr));
-      if (header->nlmsg_type == RTM_NEWROUTE) {
-        if (const auto route = readAt<rtmsg>(message)) visit(*route, message.subspan(aligned(sizeof(rtmsg))));
-        if (!dump) return true;
-      }
-      rest = rest.subspan(std::min(rest.size(), aligned(header->nlmsg_len)));
-    }
+    answer = visitRoutes(std::span(buffer.data(), static_cast<std::size_t>(received)), isDump, visit);
+    if (answer == Answer::failed) return false;
   }
+  return true;
 }
 
 bool isLinkLocal(const rtmsg& route, std::span<const std::byte> destination) noexcept {
@@ -111,6 +127,16 @@ bool isLinkLocal(const rtmsg& route, std::span<const std::byte> destination) noe
   }
   if (route.rtm_family == AF_INET && route.rtm_dst_len >= 16) return byteAt(0) == 169 && byteAt(1) == 254;
   return false;
+}
+
+// Calls `take(index)` for each living hop of a route with several.
+template <typename Take>
+void forEachHop(std::span<const std::byte> hops, Take take) {
+  while (const auto hop = readAt<rtnexthop>(hops)) {
+    if (hop->rtnh_len < sizeof(rtnexthop) || hop->rtnh_len > hops.size()) return;
+    if ((hop->rtnh_flags & RTNH_F_DEAD) == 0) take(hop->rtnh_ifindex);
+    hops = hops.subspan(std::min(hops.size(), aligned(hop->rtnh_len)));
+  }
 }
 
 void collect(const rtmsg& route, std::span<const std::byte> attributes, unsigned loopback,
@@ -129,18 +155,14 @@ void collect(const rtmsg& route, std::span<const std::byte> attributes, unsigned
     if (type == RTA_OIF) {
       if (const auto index = readAt<int>(payload)) take(*index);
     } else if (type == RTA_MULTIPATH) {
-      while (const auto hop = readAt<rtnexthop>(payload)) {
-        if (hop->rtnh_len < sizeof(rtnexthop) || hop->rtnh_len > payload.size()) return;
-        if ((hop->rtnh_flags & RTNH_F_DEAD) == 0) take(hop->rtnh_ifindex);
-        payload = payload.subspan(std::min(payload.size(), aligned(hop->rtnh_len)));
-      }
+      forEachHop(payload, take);
     }
   });
 }
 
 }  // namespace
 
-std::optional<unsigned> interfaceTowards(const sockaddr& peer) noexcept try {
+std::optional<unsigned> interfaceTo(const sockaddr& peer) {
   std::array<std::byte, 16> address{};
   std::size_t length = 0;
   auto family = static_cast<std::uint8_t>(peer.sa_family);
@@ -178,11 +200,9 @@ std::optional<unsigned> interfaceTowards(const sockaddr& peer) noexcept try {
     });
   });
   return answered ? found : std::nullopt;
-} catch (...) {
-  return std::nullopt;  // out of memory
 }
 
-std::optional<std::set<unsigned>> interfacesWithRoutes() noexcept try {
+std::optional<std::set<unsigned>> interfacesWithRoutes() {
   std::set<unsigned> interfaces;
   const unsigned loopback = ::if_nametoindex("lo");
   bool answered = false;
@@ -195,8 +215,6 @@ std::optional<std::set<unsigned>> interfacesWithRoutes() noexcept try {
   }
   if (!answered) return std::nullopt;
   return interfaces;
-} catch (...) {
-  return std::nullopt;  // out of memory
 }
 
 }  // namespace brenvik

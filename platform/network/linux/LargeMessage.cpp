@@ -3,11 +3,11 @@
 #include "platform/network/linux/LargeMessage.h"
 
 #include <sys/stat.h>
-#include <unistd.h>
 
-#include <cerrno>
 #include <new>
 #include <utility>
+
+#include "platform/base/WriteAll.h"
 
 namespace brenvik {
 namespace {
@@ -17,13 +17,9 @@ enum class Travels : std::uint8_t { here = 0, inMemory = 1 };
 
 UniqueFd sealedCopy(std::span<const std::byte> bytes) {
   UniqueFd memory = makeSealableMemory("brenvik-message");
-  while (memory.isValid() && !bytes.empty()) {
-    const auto written = ::write(memory.get(), bytes.data(), bytes.size());
-    if (written < 0 && errno == EINTR) continue;
-    if (written <= 0) throw std::bad_alloc();
-    bytes = bytes.subspan(static_cast<std::size_t>(written));
+  if (!memory.isValid() || writeAll(memory.get(), bytes) != 0 || !sealMemory(memory.get())) {
+    throw std::bad_alloc();
   }
-  if (!memory.isValid() || !sealMemory(memory.get())) throw std::bad_alloc();
   return memory;
 }
 

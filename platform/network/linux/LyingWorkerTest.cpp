@@ -309,14 +309,14 @@ TEST_F(LyingWorkerTest, OfASortOfQuestionsTheWorkerHasNoMoreThanTheMost) {
                   return true;
                 });
   };
-  for (std::size_t i = 0; i < NetworkAnswers::kMostOpen + 5; ++i) ask(NetworkWork::web);
+  for (std::size_t i = 0; i < NetworkAnswers::kMaxOpen + 5; ++i) ask(NetworkWork::web);
   ask(NetworkWork::reverseGeocode);  // has its own line, and comes after them
   for (const auto end = Clock::now() + 10s;
-       worker.opened() < static_cast<int>(NetworkAnswers::kMostOpen) + 1 && Clock::now() < end;)
+       worker.opened() < static_cast<int>(NetworkAnswers::kMaxOpen) + 1 && Clock::now() < end;)
     std::this_thread::yield();
-  EXPECT_EQ(worker.opened(), static_cast<int>(NetworkAnswers::kMostOpen) + 1);
+  EXPECT_EQ(worker.opened(), static_cast<int>(NetworkAnswers::kMaxOpen) + 1);
   patient.shutDown();
-  EXPECT_EQ(cancelled, NetworkAnswers::kMostOpen + 6);
+  EXPECT_EQ(cancelled, NetworkAnswers::kMaxOpen + 6);
 }
 
 TEST_F(LyingWorkerTest, ARefusalEndsTheQuestionAndNotTheWorker) {

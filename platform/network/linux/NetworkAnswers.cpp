@@ -10,11 +10,10 @@
 #include <list>
 #include <mutex>
 #include <new>
-#include <semaphore>
-#include <thread>
 #include <utility>
 
 #include "platform/base/SealedMemory.h"
+#include "platform/runloop/RunAndWait.h"
 
 namespace brenvik {
 namespace {
@@ -24,7 +23,7 @@ using std::chrono::milliseconds;
 
 constexpr const char kQueueLabel[] = "network worker";
 // Signs of life within one longest silence; a correct worker gives six. More are a flood.
-constexpr int kMostSignsOfLife = 60;
+constexpr int kMaxSignsOfLife = 60;
 constexpr auto kTimerLeeway = milliseconds(100);
 
 // What comes along with an answer is sealed memory; of anything else the last close could wait for ever.
@@ -92,18 +91,8 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
       used = used_;
     }
     if (queue == nullptr || !used) return;
-    // Whoever waits for an answer waits until this is done, so it is, however long memory is short.
-    for (std::binary_semaphore abandoned(0);;) {
-      try {
-        queue->post([this, &abandoned] {
-          abandonAll();
-          abandoned.release();
-        });
-        return abandoned.acquire();
-      } catch (const std::bad_alloc&) {
-        std::this_thread::sleep_for(milliseconds(10));
-      }
-    }
+    // Whoever waits for an answer waits until this is done.
+    runAndWait(*queue, [this] { abandonAll(); });
   }
 
  private:
@@ -134,7 +123,7 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
   void start(const std::shared_ptr<Question>& question) noexcept {
     try {
       auto& line = lineOf(*question);
-      if (line.open >= kMostOpen) return line.waiting.push_back(question);
+      if (line.open >= kMaxOpen) return line.waiting.push_back(question);
       begin(question);
     } catch (const std::bad_alloc&) {
       tell(*question, Ended::refused, nullptr);
@@ -187,7 +176,7 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
     switch (static_cast<NetworkMessage>(message.kind)) {
       case NetworkMessage::alive:
         at->heard = Clock::now();
-        if (++at->signsOfLife > kMostSignsOfLife || !message.payload.empty()) giveUp(at);
+        if (++at->signsOfLife > kMaxSignsOfLife || !message.payload.empty()) giveUp(at);
         return;
       case NetworkMessage::answer:
         return end(at, Ended::answered, &message);
@@ -223,7 +212,7 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
     over.clear();
     // One that cannot even begin ends here again: a loop, and no recursion, however many wait.
     if (std::exchange(admitting_, true)) return;
-    while (line.open < kMostOpen && !line.waiting.empty()) {
+    while (line.open < kMaxOpen && !line.waiting.empty()) {
       const auto next = std::move(line.waiting.front());
       line.waiting.pop_front();
       start(next);

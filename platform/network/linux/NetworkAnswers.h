@@ -20,7 +20,7 @@ class NetworkAnswers {
  public:
   // Questions of one sort that the worker has at a time; further ones wait here for their turn. As many as a
   // reverse geocoder at its pace can leave open, and far fewer than there are descriptors.
-  static constexpr std::size_t kMostOpen = 24;
+  static constexpr std::size_t kMaxOpen = 24;
 
   enum class Ended {
     answered,

@@ -5,7 +5,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
-#include <new>
 #include <utility>
 
 #include "platform/network/EchoMessages.h"
@@ -61,14 +60,10 @@ class Conversation {
 
 // One look-up, in a conversation of its own.
 template <typename Decode>
-auto lookUp(Worker& worker, EchoMessageKind kind, const char* name, milliseconds patience,
-            Decode decode) noexcept -> decltype(decode(std::span<const std::byte>())) {
-  try {
-    if (std::strlen(name) > kLongestName) return {};
-    return Conversation(worker).ask(kind, encodeName(name), patience, decode);
-  } catch (const std::bad_alloc&) {
-    return {};
-  }
+auto lookUp(Worker& worker, EchoMessageKind kind, const char* name, milliseconds patience, Decode decode)
+    -> decltype(decode(std::span<const std::byte>())) {
+  if (std::strlen(name) > kLongestName) return {};
+  return Conversation(worker).ask(kind, encodeName(name), patience, decode);
 }
 
 }  // namespace
@@ -78,12 +73,12 @@ class RemoteEchoNetwork::Socket final : public EchoSocket {
   Socket(Conversation conversation, EchoSocketForm form, milliseconds patience) noexcept
       : conversation_(std::move(conversation)), form_(form), patience_(patience) {}
 
-  void setReceiveBufferSize(int bytes) noexcept override {
+  void setReceiveBufferSize(int bytes) override {
     tell(EchoMessageKind::setReceiveBufferSize, static_cast<std::uint32_t>(std::max(bytes, 0)));
   }
-  void bindToInterface(unsigned index) noexcept override { tell(EchoMessageKind::bindToInterface, index); }
+  void bindToInterface(unsigned index) override { tell(EchoMessageKind::bindToInterface, index); }
 
-  int setReceiveTimeOut(std::chrono::microseconds timeOut) noexcept override try {
+  int setReceiveTimeOut(std::chrono::microseconds timeOut) override {
     // Zero would be for ever.
     const auto microseconds = std::clamp<std::int64_t>(timeOut.count(), 1, UINT32_MAX);
     const auto error =
@@ -92,22 +87,18 @@ class RemoteEchoNetwork::Socket final : public EchoSocket {
     if (!error || !*error || **error > kLargestError) return EPIPE;
     timeOut_ = std::chrono::ceil<milliseconds>(std::chrono::microseconds(microseconds));
     return static_cast<int>(**error);
-  } catch (const std::bad_alloc&) {
-    return ENOMEM;
   }
 
-  EchoTransfer sendTo(in_addr destination, std::span<const std::byte> message) noexcept override try {
+  EchoTransfer sendTo(in_addr destination, std::span<const std::byte> message) override {
     if (message.size() > kLongestEcho) return {-1, EMSGSIZE};
     const auto answer = conversation_.ask(
         EchoMessageKind::sendTo, encodeSend(destination, message), patience_,
         [&](std::span<const std::byte> payload) { return decodeTransfer(payload, message.size()); });
     if (!answer) return {-1, EPIPE};
     return answer->transfer;
-  } catch (const std::bad_alloc&) {
-    return {-1, ENOMEM};
   }
 
-  EchoTransfer receive(std::span<std::byte> buffer) noexcept override try {
+  EchoTransfer receive(std::span<std::byte> buffer) override {
     const auto largest = std::min(buffer.size(), kLongestEcho);
     const auto answer = conversation_.ask(
         EchoMessageKind::receive, encodeNumber(static_cast<std::uint32_t>(largest)), timeOut_ + patience_,
@@ -116,8 +107,6 @@ class RemoteEchoNetwork::Socket final : public EchoSocket {
     if (answer->transfer.count >= 0) std::copy(answer->bytes.begin(), answer->bytes.end(), buffer.begin());
     return {answer->transfer.count < 0 ? -1 : static_cast<std::ptrdiff_t>(answer->bytes.size()),
             answer->transfer.error};
-  } catch (const std::bad_alloc&) {
-    return {-1, ENOMEM};
   }
 
   bool deliversIpHeader() const noexcept override { return form_ == EchoSocketForm::withIpHeader; }
@@ -125,11 +114,8 @@ class RemoteEchoNetwork::Socket final : public EchoSocket {
  private:
   static constexpr std::uint32_t kLargestError = 4095;
 
-  void tell(EchoMessageKind kind, std::uint32_t number) noexcept {
-    try {
-      (void)conversation_.tell(kind, encodeNumber(number));  // as promised, nothing is told
-    } catch (const std::bad_alloc&) {                        // likewise
-    }
+  void tell(EchoMessageKind kind, std::uint32_t number) {
+    (void)conversation_.tell(kind, encodeNumber(number));  // as promised, nothing is told
   }
 
   Conversation conversation_;
@@ -138,7 +124,7 @@ class RemoteEchoNetwork::Socket final : public EchoSocket {
   milliseconds timeOut_{0};
 };
 
-std::optional<in_addr> RemoteEchoNetwork::addressOfHost(const char* name) noexcept {
+std::optional<in_addr> RemoteEchoNetwork::addressOfHost(const char* name) {
   const auto number = lookUp(worker_, EchoMessageKind::addressOfHost, name, kLookUpPatience, decodeNumber);
   if (!number || !*number) return std::nullopt;
   in_addr address{};
@@ -146,27 +132,24 @@ std::optional<in_addr> RemoteEchoNetwork::addressOfHost(const char* name) noexce
   return address;
 }
 
-std::optional<int> RemoteEchoNetwork::protocolByName(const char* name) noexcept {
+std::optional<int> RemoteEchoNetwork::protocolByName(const char* name) {
   const auto number = lookUp(worker_, EchoMessageKind::protocolByName, name, patience_, decodeNumber);
   constexpr std::uint32_t kLargestProtocol = 255;
   if (!number || !*number || **number > kLargestProtocol) return std::nullopt;
   return static_cast<int>(**number);
 }
 
-unsigned RemoteEchoNetwork::indexOfInterface(const char* name) noexcept {
+unsigned RemoteEchoNetwork::indexOfInterface(const char* name) {
   const auto number = lookUp(worker_, EchoMessageKind::indexOfInterface, name, patience_, decodeNumber);
   return number ? number->value_or(0) : 0;
 }
 
-std::unique_ptr<EchoSocket> RemoteEchoNetwork::openEchoSocket(int protocol, std::uint16_t identifier) noexcept
-    try {
+std::unique_ptr<EchoSocket> RemoteEchoNetwork::openEchoSocket(int protocol, std::uint16_t identifier) {
   Conversation conversation(worker_);
   const auto form = conversation.ask(EchoMessageKind::openSocket, encodeSocket(protocol, identifier),
                                      patience_, decodeForm);
   if (!form || *form == EchoSocketForm::none) return nullptr;
   return std::make_unique<Socket>(std::move(conversation), *form, patience_);
-} catch (const std::bad_alloc&) {
-  return nullptr;
 }
 
 int RemoteEchoNetwork::timeOfDay(timeval* now) noexcept { return ::gettimeofday(now, nullptr); }

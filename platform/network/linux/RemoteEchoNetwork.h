@@ -23,10 +23,10 @@ class RemoteEchoNetwork final : public EchoNetwork {
   explicit RemoteEchoNetwork(Worker& worker, std::chrono::milliseconds patience = kPatience) noexcept
       : worker_(worker), patience_(patience) {}
 
-  std::optional<in_addr> addressOfHost(const char* name) noexcept override;
-  std::optional<int> protocolByName(const char* name) noexcept override;
-  std::unique_ptr<EchoSocket> openEchoSocket(int protocol, std::uint16_t identifier) noexcept override;
-  unsigned indexOfInterface(const char* name) noexcept override;
+  std::optional<in_addr> addressOfHost(const char* name) override;
+  std::optional<int> protocolByName(const char* name) override;
+  std::unique_ptr<EchoSocket> openEchoSocket(int protocol, std::uint16_t identifier) override;
+  unsigned indexOfInterface(const char* name) override;
   int timeOfDay(timeval* now) noexcept override;
   std::chrono::microseconds steadyTime() noexcept override;
 

@@ -5,13 +5,13 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/eventfd.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <new>
 #include <utility>
 
+#include "platform/base/WriteAll.h"
 #include "platform/network/GunzipMessages.h"
 #include "platform/worker/linux/SealedMemory.h"
 
@@ -21,7 +21,8 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 // Signs of life before a file must be unpacked: at one every kAliveInterval, more than an hour of them.
-constexpr int kMostSignsOfLife = 1000;
+constexpr int kMaxSignsOfLife = 1000;
+constexpr GunzipOutcome kOutOfMemory{GunzipResult::outOfMemory, 0, 0};
 
 UniqueFd duplicate(int fd) noexcept { return UniqueFd(::fcntl(fd, F_DUPFD_CLOEXEC, 0)); }
 
@@ -29,14 +30,7 @@ UniqueFd duplicate(int fd) noexcept { return UniqueFd(::fcntl(fd, F_DUPFD_CLOEXE
 UniqueFd sealedMemoryOf(const GunzipInput& input) noexcept {
   if (input.sealedMemory >= 0) return duplicate(input.sealedMemory);
   UniqueFd memory = makeSealableMemory("brenvik-gzip");
-  auto bytes = input.bytes;
-  while (memory.isValid() && !bytes.empty()) {
-    const auto written = ::write(memory.get(), bytes.data(), bytes.size());
-    if (written < 0 && errno == EINTR) continue;
-    if (written <= 0) return {};
-    bytes = bytes.subspan(static_cast<std::size_t>(written));
-  }
-  if (!memory.isValid() || !sealMemory(memory.get())) return {};
+  if (!memory.isValid() || writeAll(memory.get(), input.bytes) != 0 || !sealMemory(memory.get())) return {};
   return memory;
 }
 
@@ -55,15 +49,21 @@ GunzipOutcome RemoteGunzip::gunzipInto(const GunzipInput& input, int file, std::
   WorkerMessage message{static_cast<std::uint32_t>(NetworkMessage::ask), encode(question), {}};
   message.descriptors.push_back(sealedMemoryOf(input));
   message.descriptors.push_back(duplicate(file));
-  if (!message.descriptors[0].isValid() || !message.descriptors[1].isValid())
-    return {GunzipResult::outOfMemory, 0, 0};
+  if (!message.descriptors[0].isValid() || !message.descriptors[1].isValid()) return kOutOfMemory;
 
   WorkerChannel channel;
   auto result = worker_.open(static_cast<std::uint32_t>(NetworkWork::gunzip), &channel);
   if (result == WorkerResult::done) result = channel.send(message);
   message = {};
-  if (result == WorkerResult::outOfMemory) return {GunzipResult::outOfMemory, 0, 0};
+  if (result == WorkerResult::outOfMemory) return kOutOfMemory;
   if (result != WorkerResult::done) return {};
+  return awaitOutcome(question, channel);
+} catch (const std::bad_alloc&) {
+  return kOutOfMemory;
+}
+
+// Until the worker answers, says nothing for too long, talks nonsense, or shutDown() is called.
+GunzipOutcome RemoteGunzip::awaitOutcome(const GunzipQuestion& question, WorkerChannel& channel) {
   int signsOfLife = 0;
   for (auto heard = Clock::now();;) {
     const auto left = std::chrono::ceil<std::chrono::milliseconds>(heard + longestSilence_ - Clock::now());
@@ -71,29 +71,24 @@ GunzipOutcome RemoteGunzip::gunzipInto(const GunzipInput& input, int file, std::
     const int ready = ::poll(waited, 2, static_cast<int>(std::max<std::int64_t>(left.count(), 0)));
     if (ready < 0 && errno == EINTR) continue;
     if (waited[1].revents != 0) return {};
-    if (ready <= 0) break;
-    WorkerMessage answer;
-    result = channel.receive(&answer, Clock::now());
-    if (result == WorkerResult::outOfMemory) return {GunzipResult::outOfMemory, 0, 0};
+    WorkerMessage message;
+    const auto result = ready <= 0 ? WorkerResult::timedOut : channel.receive(&message, Clock::now());
+    if (result == WorkerResult::outOfMemory) return kOutOfMemory;
     if (result != WorkerResult::done) break;
-    if (!answer.descriptors.empty()) {
-      channel.discard(&answer);
+    if (!message.descriptors.empty()) {
+      channel.discard(&message);
       break;
     }
-    if (answer.kind == static_cast<std::uint32_t>(NetworkMessage::refusal))
-      return {GunzipResult::outOfMemory, 0, 0};
-    if (answer.kind == static_cast<std::uint32_t>(NetworkMessage::answer)) {
-      if (const auto outcome = decodeGunzipOutcome(answer.payload, question)) return *outcome;
-      break;
+    const auto kind = static_cast<NetworkMessage>(message.kind);
+    if (kind == NetworkMessage::refusal) return kOutOfMemory;
+    if (kind == NetworkMessage::answer) {
+      if (const auto outcome = decodeGunzipOutcome(message.payload, question)) return *outcome;
     }
-    if (answer.kind != static_cast<std::uint32_t>(NetworkMessage::alive) || !answer.payload.empty()) break;
-    if (++signsOfLife > kMostSignsOfLife) break;
+    if (kind != NetworkMessage::alive || !message.payload.empty() || ++signsOfLife > kMaxSignsOfLife) break;
     heard = Clock::now();
   }
   worker_.giveUp(&channel);
   return {};
-} catch (const std::bad_alloc&) {
-  return {GunzipResult::outOfMemory, 0, 0};
 }
 
 }  // namespace brenvik

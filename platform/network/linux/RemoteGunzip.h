@@ -6,6 +6,7 @@
 
 #include "platform/base/UniqueFd.h"
 #include "platform/gzip/Gunzip.h"
+#include "platform/network/GunzipMessages.h"
 #include "platform/network/NetworkWork.h"
 #include "platform/worker/Worker.h"
 
@@ -25,6 +26,8 @@ class RemoteGunzip final : public Gunzip {
   void shutDown() noexcept;
 
  private:
+  GunzipOutcome awaitOutcome(const GunzipQuestion& question, WorkerChannel& channel);
+
   Worker& worker_;
   const std::chrono::milliseconds longestSilence_;
   const UniqueFd stop_;  // readable once shut down

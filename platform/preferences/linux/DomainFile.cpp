@@ -19,6 +19,7 @@
 
 #include "platform/base/ErrorText.h"
 #include "platform/base/Rename.h"
+#include "platform/base/WriteAll.h"
 #include "platform/log/Log.h"
 #include "platform/plist/PropertyListCodec.h"
 
@@ -34,7 +35,7 @@ constexpr const char kTemporaryName[] = ".brenvik-preferences.tmp";
 constexpr std::int64_t kSettlingTime = 50'000'000;  // ns
 // How often a file is read again that changed while it was read.
 constexpr int kReadAttempts = 3;
-constexpr int kMostMovedAside = 1000;
+constexpr int kMaxMovedAside = 1000;
 
 std::int64_t nanoseconds(const timespec& time) noexcept {
   return std::int64_t{time.tv_sec} * 1'000'000'000 + time.tv_nsec;
@@ -74,25 +75,7 @@ int writeAll(int file, std::span<const std::string_view> content) noexcept {
       pieces[count++] = {const_cast<char*>(piece.data()), piece.size()};
     }
   }
-  iovec* next = pieces.data();
-  while (count > 0) {
-    const ssize_t written = ::writev(file, next, static_cast<int>(count));
-    if (written < 0) {
-      if (errno == EINTR) continue;
-      return errno;
-    }
-    auto left = static_cast<std::size_t>(written);
-    while (count > 0 && left >= next->iov_len) {
-      left -= next->iov_len;
-      ++next;
-      --count;
-    }
-    if (left > 0) {
-      next->iov_base = static_cast<char*>(next->iov_base) + left;
-      next->iov_len -= left;
-    }
-  }
-  return 0;
+  return brenvik::writeAll(file, std::span(pieces.data(), count));
 }
 
 }  // namespace
@@ -284,7 +267,7 @@ bool DomainFile::replace(int folder, std::span<const std::string_view> content, 
 bool DomainFile::moveAside(int folder, const Attempt& attempt) const {
   const char* const reason = attempt.error != 0 ? describeError(attempt.error) : attempt.damage;
   int error = 0;
-  for (int number = 1; number <= kMostMovedAside; ++number) {
+  for (int number = 1; number <= kMaxMovedAside; ++number) {
     const std::string suffix = ".damaged-" + std::to_string(number);
     // A long name is cut, so that it fits with the suffix.
     const std::string name = place_.name.substr(0, NAME_MAX - suffix.size()) + suffix;

@@ -184,7 +184,7 @@ DomainImage::Change DomainImage::set(std::string_view key, const PropertyList& v
   bplist::Extractor extractor(*document);
   if (!extractor.select(document->top())) return Change::refused;
   // The domain's dictionary is one more level around the value.
-  if (extractor.extent().depth + 1 > kDeepestPropertyList) return Change::refused;
+  if (extractor.extent().depth + 1 > kMaxPropertyListDepth) return Change::refused;
 
   makeRoomFor(otherObjects + extractor.objects() + 1);
   Draft draft;

@@ -161,7 +161,7 @@ TEST(DomainImageTest, AValueIsRefusedThatWouldMakeTheDomainUnreadable) {
   DomainImage image;
   ASSERT_EQ(image.set("stays", PropertyList::string("here")), DomainImage::Change::made);
   PropertyList deep = PropertyList::integer(1);
-  for (std::size_t i = 0; i < kDeepestPropertyList - 1; ++i) deep = PropertyList::array({deep});
+  for (std::size_t i = 0; i < kMaxPropertyListDepth - 1; ++i) deep = PropertyList::array({deep});
   EXPECT_EQ(image.set("deep", deep), DomainImage::Change::made);
   EXPECT_TRUE(written(image)) << "just as deep as can be read";
   EXPECT_EQ(image.set("deeper", PropertyList::array({deep})), DomainImage::Change::refused);
@@ -178,7 +178,7 @@ TEST(DomainImageTest, AnEmptyContainerIsALevelToo) {
   for (const PropertyList& empty : {PropertyList::array({}), PropertyList::dictionary({})}) {
     DomainImage image;
     PropertyList deep = empty;
-    for (std::size_t i = 1; i < kDeepestPropertyList - 1; ++i) deep = PropertyList::array({deep});
+    for (std::size_t i = 1; i < kMaxPropertyListDepth - 1; ++i) deep = PropertyList::array({deep});
     EXPECT_EQ(image.set("deep", deep), DomainImage::Change::made);
     EXPECT_TRUE(written(image)) << "just as deep as can be read";
     EXPECT_EQ(image.set("deeper", PropertyList::array({deep})), DomainImage::Change::refused);

@@ -3,7 +3,6 @@
 #include "platform/preferences/linux/FilePreferences.h"
 
 #include <fcntl.h>
-#include <pwd.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -15,6 +14,7 @@
 #include <vector>
 
 #include "platform/base/ErrorText.h"
+#include "platform/base/PasswordEntry.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
 #include "platform/preferences/linux/DomainFile.h"
@@ -28,24 +28,14 @@ namespace brenvik {
 namespace {
 
 // Clients name domains freely; each that is kept costs its content and one descriptor.
-constexpr std::size_t kMostDomains = 16;
-constexpr std::size_t kMostKeptBytes = std::size_t{16} << 20;
+constexpr std::size_t kMaxDomains = 16;
+constexpr std::size_t kMaxKeptBytes = std::size_t{16} << 20;
 
 std::string homeOfEffectiveUser(int* failure) {
-  std::vector<char> buffer(1024);
-  passwd entry{};
-  passwd* found = nullptr;
-  int error = 0;
-  errno = 0;
-  while ((error = ::getpwuid_r(::geteuid(), &entry, buffer.data(), buffer.size(), &found)) == ERANGE) {
-    buffer.resize(buffer.size() * 2);
-    errno = 0;
-  }
-  if (error == 0 && found != nullptr && found->pw_dir != nullptr) return found->pw_dir;
-  // A look-up that failed may say that there is no such account; errno keeps the truth.
-  if (error == ENOMEM || errno == ENOMEM) throw std::bad_alloc();
-  *failure = error != 0 ? error : errno;
-  return {};
+  std::optional<PasswordEntry> entry;
+  *failure = readPasswordEntry(::geteuid(), &entry);
+  if (*failure == ENOMEM) throw std::bad_alloc();
+  return entry ? entry->home : std::string();
 }
 
 // machine-id(5): 32 lower-case hexadecimal digits and a line feed.
@@ -279,7 +269,7 @@ std::shared_ptr<FilePreferences::Domain> FilePreferences::find(std::string_view 
     const auto weight = one->use_count() > 1 ? std::nullopt : (*one)->weight();
     ++count;
     bytes += weight.value_or(0);
-    one = weight && (count >= kMostDomains || bytes > kMostKeptBytes) ? domains_.erase(one) : std::next(one);
+    one = weight && (count >= kMaxDomains || bytes > kMaxKeptBytes) ? domains_.erase(one) : std::next(one);
   }
   domains_.push_front(std::make_shared<Domain>(std::move(*place), std::string(domain),
                                                PreferencesScope{user, host}, patience_));

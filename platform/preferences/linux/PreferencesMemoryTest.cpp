@@ -1,46 +1,20 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 //
-// Every allocation of a set and of a read fails once, alone and with all that follow it. The C library's
-// functions are replaced for this program; sanitizers have replaced them already, so there this is left out.
+// Every allocation of a set and of a read fails once, alone and with all that follow it. Not
+// with a sanitizer, which has the C library's functions to itself.
 #include <gtest/gtest.h>
 
-#include <cstdlib>
+#include <optional>
 #include <span>
 #include <string>
 
+#include "platform/base/fakes/FailingMalloc.h"
 #include "platform/log/Log.h"
 #include "platform/plist/PropertyListCodec.h"
 #include "platform/preferences/linux/TestHome.h"
 
-#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
-
-namespace {
-
-constinit thread_local bool armed = false;
-constinit thread_local bool allFollowing = false;
-constinit thread_local long untilFailure = 0;
-constinit thread_local long failures = 0;
-
-bool failsNow() {
-  if (!armed || untilFailure-- > 0) return false;
-  if (untilFailure != -1 && !allFollowing) return false;
-  ++failures;
-  return true;
-}
-
-}  // namespace
-
-extern "C" {
-void* __libc_malloc(std::size_t size);
-void* __libc_calloc(std::size_t count, std::size_t size);
-void* __libc_realloc(void* memory, std::size_t size);
-void* malloc(std::size_t size) { return failsNow() ? nullptr : __libc_malloc(size); }
-void* calloc(std::size_t count, std::size_t size) {
-  return failsNow() ? nullptr : __libc_calloc(count, size);
-}
-void* realloc(void* memory, std::size_t size) { return failsNow() ? nullptr : __libc_realloc(memory, size); }
-}
+#ifndef BRENVIK_MALLOC_IS_TAKEN
 
 namespace brenvik {
 namespace {
@@ -49,7 +23,7 @@ constexpr auto kUser = UserScope::currentUser;
 constexpr auto kHost = HostScope::anyHost;
 constexpr const char kDomain[] = "com.example.memory";
 
-class PreferencesMemoryTest : public testing::TestWithParam<bool> {
+class PreferencesMemoryTest : public testing::TestWithParam<FailingMalloc::HowMany> {
  protected:
   PreferencesMemoryTest() { setLogSink(nullptr); }
 
@@ -59,15 +33,12 @@ class PreferencesMemoryTest : public testing::TestWithParam<bool> {
     long next = 0;
     while (true) {
       ASSERT_NO_FATAL_FAILURE(prepare());
-      armed = true;
-      allFollowing = GetParam();
-      untilFailure = next;
-      failures = 0;
+      std::optional<FailingMalloc> failing(std::in_place, next, GetParam());
       const bool answer = work();
-      armed = false;
+      failing.reset();
       SCOPED_TRACE("allocation " + std::to_string(next));
       ASSERT_NO_FATAL_FAILURE(check(answer));
-      if (failures == 0) break;
+      if (FailingMalloc::failures() == 0) break;
       ++next;
     }
     EXPECT_TRUE(wasAnswered) << "without a failure it succeeds";
@@ -134,14 +105,15 @@ TEST_P(PreferencesMemoryTest, AReadGivesTheValueOrNoneAndAGoodFileStaysInItsPlac
       },
       [&] {
         const PropertyList found = store->copyApplicationValue("nested", kDomain);
-        armed = false;
+        const FailingMalloc::Pause pause;
         if (!found) return false;
         EXPECT_EQ(found, before.find("nested"));
         return true;
       });
 }
 
-INSTANTIATE_TEST_SUITE_P(AloneAndWithAllThatFollow, PreferencesMemoryTest, testing::Bool());
+INSTANTIATE_TEST_SUITE_P(AloneAndWithAllThatFollow, PreferencesMemoryTest,
+                         testing::Values(FailingMalloc::HowMany::one, FailingMalloc::HowMany::all));
 
 }  // namespace
 }  // namespace brenvik

@@ -14,7 +14,7 @@ class SdBus {
   // `library` is kept, not copied.
   explicit SdBus(const char* library) noexcept : library_(library) {}
 
-  // False while the library, or one of the functions, cannot be had: then none may be called. The next call
+  // False when the library or one of its functions cannot be loaded: then none may be called. The next call
   // looks again, since only memory or descriptors may have been missing. Reads files: not on the main loop.
   bool load() noexcept;
 

@@ -31,7 +31,7 @@ constexpr std::size_t kLargestFile = std::size_t{1} << 20;
 constexpr std::string_view kSuffix = ".plist";
 constexpr std::string_view kDefaultUser = "root";
 // An administrator has a handful of files; where so many are wrong, some are told again.
-constexpr std::size_t kMostTold = 1024;
+constexpr std::size_t kMaxToldCallers = 1024;
 
 constexpr const char kChangeable[] = "not owned by root, or others may write to it";
 
@@ -480,7 +480,7 @@ bool EntitlementSearch::isNews(const std::string& path, FileState state) {
       return false;
     }
   }
-  if (known == told_.end() && told_.size() >= kMostTold) told_.clear();
+  if (known == told_.end() && told_.size() >= kMaxToldCallers) told_.clear();
   told_.insert_or_assign(path, std::move(state));
   return true;
 }

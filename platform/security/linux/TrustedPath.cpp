@@ -13,7 +13,7 @@
 namespace brenvik {
 namespace {
 
-constexpr int kMostLinks = 40;  // as many as the kernel follows
+constexpr int kMaxLinks = 40;  // as many as the kernel follows
 
 bool isFolderToTrust(const struct stat& facts) noexcept {
   const bool nobodyRenamesRootsEntries = (facts.st_mode & S_ISVTX) != 0;
@@ -96,7 +96,7 @@ TrustedPath walkTrustedPath(const std::string& path) {
       at.place = std::move(next);
       return at;
     }
-    if (++links > kMostLinks) return withError(ELOOP);
+    if (++links > kMaxLinks) return withError(ELOOP);
     const ssize_t size = followLink(next, &rest);
     if (size <= 0) return withError(size == 0 ? ENOENT : errno);
     if (rest.front() == '/') at.place.clear();

@@ -5,7 +5,6 @@
 #include <cstddef>
 #include <cstdlib>
 #include <cstring>
-#include <new>
 #include <string>
 
 #include "platform/base/UniqueFd.h"
@@ -26,7 +25,7 @@ NotifySocket::NotifySocket() noexcept {
   ::unsetenv(kVariable);
 }
 
-void NotifySocket::show(const std::string& line) noexcept try {
+void NotifySocket::show(const std::string& line) {
   if (!listens()) return;
   std::string message = "STATUS=" + line;
   for (char& c : message) {
@@ -36,8 +35,6 @@ void NotifySocket::show(const std::string& line) noexcept try {
   (void)::sendto(socket.get(), message.data(), message.size(), MSG_DONTWAIT | MSG_NOSIGNAL,
                  reinterpret_cast<const sockaddr*>(&address_),
                  size_);  // it is for people, and the next one comes
-} catch (const std::bad_alloc&) {
-  // As one that cannot be sent.
 }
 
 }  // namespace brenvik

@@ -19,7 +19,7 @@ class NotifySocket final : public ServiceManager {
   NotifySocket() noexcept;
 
   bool listens() const noexcept override { return size_ != 0; }
-  void show(const std::string& line) noexcept override;
+  void show(const std::string& line) override;
 
  private:
   sockaddr_un address_{};

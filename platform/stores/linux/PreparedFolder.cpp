@@ -21,7 +21,7 @@ namespace {
 
 constexpr int kFolderFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 // More levels than a path can have.
-constexpr int kMostLevels = 4096;
+constexpr int kMaxLevels = 4096;
 
 bool isLackOf(int error) noexcept { return error == ENOMEM || error == EMFILE || error == ENFILE; }
 
@@ -39,7 +39,7 @@ bool upToTheRoot(int folder, Holds holds) noexcept {
   UniqueFd at(::openat(folder, ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
   struct stat here {};
   if (!at.isValid() || ::fstat(at.get(), &here) != 0) return false;
-  for (int level = 0; level < kMostLevels && holds(here); ++level) {
+  for (int level = 0; level < kMaxLevels && holds(here); ++level) {
     at.reset(::openat(at.get(), "..", O_PATH | O_DIRECTORY | O_CLOEXEC));
     struct stat above {};
     if (!at.isValid() || ::fstat(at.get(), &above) != 0) return false;

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <map>
+#include <new>
 #include <optional>
 #include <string>
 #include <vector>
@@ -19,44 +20,34 @@ class InMemoryVoicemailStore final : public VoicemailStore {
   bool exhausted = false;  // there is no memory
   int failures = 0;        // for so many operations there will be none
 
-  bool setToken(const std::string* token) noexcept override {
-    calls.push_back(token == nullptr ? "clearToken" : "setToken");
-    if (fails()) return false;
+  void setToken(const std::string* token) override {
+    begin(token == nullptr ? "clearToken" : "setToken");
     token_ = token == nullptr ? std::nullopt : std::optional(*token);
-    return true;
   }
-  bool setTokenForKey(const std::string& key, const std::string& token) noexcept override {
-    calls.push_back("setTokenForKey");
-    if (fails()) return false;
+  void setTokenForKey(const std::string& key, const std::string& token) override {
+    begin("setTokenForKey");
     tokens_[key] = token;
-    return true;
   }
-  bool removeAllRecords() noexcept override {
-    calls.push_back("removeAllRecords");
-    if (fails()) return false;
+  void removeAllRecords() override {
+    begin("removeAllRecords");
     tokens_.clear();
-    return true;
   }
-  bool readToken(std::optional<std::string>* token) noexcept override {
-    calls.push_back("readToken");
-    const bool failed = fails();
-    *token = failed ? std::nullopt : token_;
-    return !failed;
+  std::optional<std::string> copyToken() override {
+    begin("copyToken");
+    return token_;
   }
-  bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept override {
-    calls.push_back("readTokenForKey");
+  std::optional<std::string> copyTokenForKey(const std::string& key) override {
+    begin("copyTokenForKey");
     const auto found = tokens_.find(key);
-    const bool failed = fails();
-    *token = failed || found == tokens_.end() ? std::nullopt : std::optional(found->second);
-    return !failed;
+    return found == tokens_.end() ? std::nullopt : std::optional(found->second);
   }
 
  private:
-  bool fails() noexcept {
-    if (exhausted) return true;
-    if (failures == 0) return false;
-    --failures;
-    return true;
+  void begin(const char* call) {
+    calls.emplace_back(call);
+    if (!exhausted && failures == 0) return;
+    if (!exhausted) --failures;
+    throw std::bad_alloc();
   }
 
   std::optional<std::string> token_;

@@ -19,7 +19,7 @@ namespace brenvik {
 namespace {
 
 // "voicemail.db.damaged", then "voicemail.db.damaged.1" and so on.
-constexpr int kMostMovedAside = 100;
+constexpr int kMaxMovedAside = 100;
 
 constexpr const char* kFile = "voicemail.db";
 
@@ -192,7 +192,7 @@ int SqliteVoicemailStore::run(const Place& place, SqliteTimeLimit& limit, const 
 // Nothing in it can be read any more; a person may still want to look at it, so an earlier one stays, too.
 bool SqliteVoicemailStore::moveAside(const Place& place) {
   int error = 0;
-  for (int number = 0; number < kMostMovedAside; ++number) {
+  for (int number = 0; number < kMaxMovedAside; ++number) {
     std::string name = std::string(kFile) + ".damaged";
     if (number > 0) name += "." + std::to_string(number);
     if (renameToFreeName(place.folder, kFile, name.c_str()) == 0) {
@@ -207,63 +207,73 @@ bool SqliteVoicemailStore::moveAside(const Place& place) {
   return false;
 }
 
-bool SqliteVoicemailStore::write(const char* statement, const std::string* first,
-                                 const std::string* second) noexcept {
-  int code = SQLITE_CANTOPEN;
+// Runs `work`, which returns a code of SQLite. Logs a failure, and throws the lack of memory.
+template <typename Work>
+void SqliteVoicemailStore::perform(Purpose purpose, const Work& work) {
+  int code = SQLITE_NOMEM;
   try {
+    code = work();
+  } catch (const std::bad_alloc&) {
+    // Told like one of SQLite's own.
+  }
+  if (code != SQLITE_OK && purpose == Purpose::writing)
+    logUnified(LogLevel::error, "The voicemail store could not be written");
+  else if (code != SQLITE_OK)
+    logUnified(LogLevel::error, "The voicemail store could not be read");
+  if (isLackOfMemory(code)) throw std::bad_alloc();
+}
+
+void SqliteVoicemailStore::write(const char* statement, const std::string* first, const std::string* second) {
+  perform(Purpose::writing, [&] {
     SqliteTimeLimit limit(kPatience, time_);
+    int code = SQLITE_CANTOPEN;
     for (int attempt = 0; attempt < 2; ++attempt) {
       Place place;
       if (find(&place, Purpose::writing) != Found::database) break;
       code = run(place, limit, statement, first, second, nullptr);
       if (!isDamage(code) || !moveAside(place)) break;
     }
-  } catch (const std::bad_alloc&) {
-    code = SQLITE_NOMEM;
-  }
-  if (code != SQLITE_OK) logUnified(LogLevel::error, "The voicemail store could not be written");
-  return !isLackOfMemory(code);
+    return code;
+  });
 }
 
-bool SqliteVoicemailStore::read(const char* statement, const std::string* key,
-                                std::optional<std::string>* token) noexcept {
-  token->reset();
-  int code = SQLITE_CANTOPEN;
-  try {
+std::optional<std::string> SqliteVoicemailStore::read(const char* statement, const std::string* key) {
+  std::optional<std::string> token;
+  perform(Purpose::reading, [&] {
     SqliteTimeLimit limit(kPatience, time_);
     Place place;
-    const Found found = find(&place, Purpose::reading);
-    if (found == Found::nothing) return true;
-    if (found == Found::database) code = run(place, limit, statement, key, nullptr, token);
-  } catch (const std::bad_alloc&) {
-    code = SQLITE_NOMEM;
-  }
-  if (code != SQLITE_OK) logUnified(LogLevel::error, "The voicemail store could not be read");
-  return !isLackOfMemory(code);
+    switch (find(&place, Purpose::reading)) {
+      case Found::nothing:
+        return SQLITE_OK;
+      case Found::unusable:
+        return SQLITE_CANTOPEN;
+      case Found::database:
+        break;
+    }
+    return run(place, limit, statement, key, nullptr, &token);
+  });
+  return token;
 }
 
-bool SqliteVoicemailStore::setToken(const std::string* token) noexcept {
+void SqliteVoicemailStore::setToken(const std::string* token) {
   if (token == nullptr) return write("DELETE FROM general", nullptr, nullptr);
-  return write("INSERT INTO general(id, token) VALUES(0, ?1) ON CONFLICT(id) DO UPDATE SET token = ?1", token,
-               nullptr);
+  write("INSERT INTO general(id, token) VALUES(0, ?1) ON CONFLICT(id) DO UPDATE SET token = ?1", token,
+        nullptr);
 }
 
-bool SqliteVoicemailStore::setTokenForKey(const std::string& key, const std::string& token) noexcept {
-  return write("INSERT INTO tokens(key, token) VALUES(?1, ?2) ON CONFLICT(key) DO UPDATE SET token = ?2",
-               &key, &token);
+void SqliteVoicemailStore::setTokenForKey(const std::string& key, const std::string& token) {
+  write("INSERT INTO tokens(key, token) VALUES(?1, ?2) ON CONFLICT(key) DO UPDATE SET token = ?2", &key,
+        &token);
 }
 
-bool SqliteVoicemailStore::removeAllRecords() noexcept {
-  return write("DELETE FROM tokens", nullptr, nullptr);
+void SqliteVoicemailStore::removeAllRecords() { write("DELETE FROM tokens", nullptr, nullptr); }
+
+std::optional<std::string> SqliteVoicemailStore::copyToken() {
+  return read("SELECT token FROM general WHERE id = 0", nullptr);
 }
 
-bool SqliteVoicemailStore::readToken(std::optional<std::string>* token) noexcept {
-  return read("SELECT token FROM general WHERE id = 0", nullptr, token);
-}
-
-bool SqliteVoicemailStore::readTokenForKey(const std::string& key,
-                                           std::optional<std::string>* token) noexcept {
-  return read("SELECT token FROM tokens WHERE key = ?1", &key, token);
+std::optional<std::string> SqliteVoicemailStore::copyTokenForKey(const std::string& key) {
+  return read("SELECT token FROM tokens WHERE key = ?1", &key);
 }
 
 }  // namespace brenvik

@@ -35,11 +35,11 @@ class SqliteVoicemailStore final : public VoicemailStore {
   explicit SqliteVoicemailStore(Folder folder, SqliteTime time = SqliteTime::ofTheSystem());
   ~SqliteVoicemailStore() override;
 
-  bool setToken(const std::string* token) noexcept override;
-  bool setTokenForKey(const std::string& key, const std::string& token) noexcept override;
-  bool removeAllRecords() noexcept override;
-  bool readToken(std::optional<std::string>* token) noexcept override;
-  bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept override;
+  void setToken(const std::string* token) override;
+  void setTokenForKey(const std::string& key, const std::string& token) override;
+  void removeAllRecords() override;
+  std::optional<std::string> copyToken() override;
+  std::optional<std::string> copyTokenForKey(const std::string& key) override;
 
  private:
   class Database;
@@ -52,8 +52,10 @@ class SqliteVoicemailStore final : public VoicemailStore {
   int run(const Place& place, SqliteTimeLimit& limit, const char* statement, const std::string* first,
           const std::string* second, std::optional<std::string>* result);
   static bool moveAside(const Place& place);
-  bool write(const char* statement, const std::string* first, const std::string* second) noexcept;
-  bool read(const char* statement, const std::string* key, std::optional<std::string>* token) noexcept;
+  template <typename Work>
+  static void perform(Purpose purpose, const Work& work);
+  void write(const char* statement, const std::string* first, const std::string* second);
+  std::optional<std::string> read(const char* statement, const std::string* key);
 
   const Folder folder_;
   const SqliteTime time_;

@@ -53,14 +53,14 @@ class StoreAtHome final : public VoicemailStore {
               return state == StoreFolder::State::open ? opened_.descriptor.get() : -1;
             },
             time) {}
-  bool setToken(const std::string* token) noexcept override { return store_.setToken(token); }
-  bool setTokenForKey(const std::string& key, const std::string& token) noexcept override {
-    return store_.setTokenForKey(key, token);
+  void setToken(const std::string* token) override { store_.setToken(token); }
+  void setTokenForKey(const std::string& key, const std::string& token) override {
+    store_.setTokenForKey(key, token);
   }
-  bool removeAllRecords() noexcept override { return store_.removeAllRecords(); }
-  bool readToken(std::optional<std::string>* token) noexcept override { return store_.readToken(token); }
-  bool readTokenForKey(const std::string& key, std::optional<std::string>* token) noexcept override {
-    return store_.readTokenForKey(key, token);
+  void removeAllRecords() override { store_.removeAllRecords(); }
+  std::optional<std::string> copyToken() override { return store_.copyToken(); }
+  std::optional<std::string> copyTokenForKey(const std::string& key) override {
+    return store_.copyTokenForKey(key);
   }
 
  private:

@@ -24,7 +24,7 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 // The helper has one connection, and one that is restarted has one more for a moment.
-constexpr std::size_t kMostConnections = 8;
+constexpr std::size_t kMaxConnections = 8;
 
 bool isRoots(int connection) noexcept {
   ucred peer{};
@@ -55,7 +55,7 @@ class Connections {
       std::vector<pollfd> waited;
       for (const WorkerChannel& channel : channels_) waited.push_back({channel.descriptor(), POLLIN, 0});
       // One that is full of connections leaves the others in the socket.
-      if (listening.isValid() && channels_.size() < kMostConnections)
+      if (listening.isValid() && channels_.size() < kMaxConnections)
         waited.push_back({listening.get(), POLLIN, 0});
       if (waited.empty()) return;
       if (::poll(waited.data(), waited.size(), -1) < 0) {

@@ -30,7 +30,7 @@ using std::chrono::milliseconds;
 
 // A process that waits in the kernel for somebody's file system outlives its SIGKILL. With so many of them,
 // no further worker is started.
-constexpr std::size_t kMostDying = 8;
+constexpr std::size_t kMaxDying = 8;
 // How long a worker that was killed, or has closed its end, is waited for, on the caller's thread: a hundred
 // times what it takes.
 constexpr milliseconds kToBeReaped{20};
@@ -58,7 +58,7 @@ std::vector<std::string> workerProgramFolders() {
 
 WorkerProgram::WorkerProgram(Description description, std::function<Clock::time_point()> now)
     : description_(std::move(description)), now_(std::move(now)) {
-  dying_.reserve(kMostDying);
+  dying_.reserve(kMaxDying);
 }
 
 WorkerProgram::~WorkerProgram() { endWorker(kToLeave); }
@@ -193,7 +193,7 @@ WorkerResult WorkerProgram::startChild() {
   if (const WorkerResult made = WorkerChannel::makePair(&ours, &theirs); made != WorkerResult::done)
     return made;
   int error = EAGAIN;
-  if (dying_.size() < kMostDying) {
+  if (dying_.size() < kMaxDying) {
     for (const std::string& folder :
          description_.folders.empty() ? workerProgramFolders() : description_.folders) {
       error = start(folder + "/" + description_.program, theirs.descriptor());

@@ -14,13 +14,12 @@
 #include <mutex>
 #include <new>
 #include <optional>
-#include <semaphore>
 #include <span>
 #include <string_view>
-#include <thread>
 #include <utility>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/runloop/RunAndWait.h"
 #include "platform/web/linux/curl/ResponseHead.h"
 
 namespace brenvik {
@@ -32,7 +31,7 @@ using std::chrono::milliseconds;
 constexpr const char kQueueLabel[] = "HTTP client";
 // Below this rate for the whole of the stall limit, a transfer is given up.
 constexpr long kStallBytesPerSecond = 200;
-constexpr int kMostRedirects = 10;
+constexpr int kMaxRedirects = 10;
 constexpr long kReceiveBufferSize = 256L * 1024;
 // Wake-ups for time-outs may be put off by this much.
 constexpr auto kTimerLeeway = milliseconds(1);
@@ -122,7 +121,7 @@ struct CurlWebClient::Transfer {
   List headerList;
   Easy easy;
   ResponseHead head;
-  bool wayWasCellular = false;
+  bool isOnCellular = false;
   std::optional<WebErrorKind> ownVerdict;  // why one of our callbacks stopped it
 
   // Tells the outcome, the first time only; somebody may be waiting for it without a limit.
@@ -220,7 +219,7 @@ curl_socket_t CurlWebClient::Transfer::onOpenSocket(void* self, curlsocktype,
   if (!fd.isValid()) return CURL_SOCKET_BAD;
   if (!transfer.cellularAllowed) {
     const ConnectionWay way = routeTo(address->addr, transfer.settings->cellularFiles);
-    if (way.kind == ConnectionWay::Kind::cellular) transfer.wayWasCellular = true;
+    if (way.kind == ConnectionWay::Kind::cellular) transfer.isOnCellular = true;
     if (way.kind != ConnectionWay::Kind::open) return CURL_SOCKET_BAD;
     if (::setsockopt(fd.get(), SOL_SOCKET, SO_BINDTODEVICE, way.interfaceName.c_str(),
                      static_cast<socklen_t>(way.interfaceName.size() + 1)) != 0) {
@@ -286,18 +285,8 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
       abandonAll(WebErrorKind::cancelled);
       return;
     }
-    // Whoever waits for a transfer waits until this is done, so it is, however long memory is short.
-    for (std::binary_semaphore abandoned(0);;) {
-      try {
-        queue->post([this, &abandoned] {
-          abandonAll(WebErrorKind::cancelled);
-          abandoned.release();
-        });
-        return abandoned.acquire();
-      } catch (const std::bad_alloc&) {
-        std::this_thread::sleep_for(milliseconds(10));
-      }
-    }
+    // Whoever waits for a transfer waits until this is done.
+    runAndWait(*queue, [this] { abandonAll(WebErrorKind::cancelled); });
   }
 
  private:
@@ -337,7 +326,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
 
     transfer->response->body = settings_.bodiesForAnotherProcess ? WebBody::forAnotherProcess() : WebBody();
     transfer->head = ResponseHead();
-    transfer->wayWasCellular = false;
+    transfer->isOnCellular = false;
     transfer->ownVerdict.reset();
     transfer->easy.reset(curl_easy_init());
     if (transfer->easy == nullptr || !setUp(*transfer, left))
@@ -535,7 +524,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
   void follow(const std::shared_ptr<Transfer>& transfer, const std::string& location) {
     const auto url = parseUrl(location);
     if (!url || url->scheme != "https") return transfer->finish(WebErrorKind::redirectRefused);
-    if (++transfer->redirects > kMostRedirects) return transfer->finish(WebErrorKind::tooManyRedirects);
+    if (++transfer->redirects > kMaxRedirects) return transfer->finish(WebErrorKind::tooManyRedirects);
     transfer->url = location;
     attempt(transfer);
   }
@@ -548,7 +537,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
       case CURLE_COULDNT_RESOLVE_HOST:
         return WebErrorKind::hostNotFound;
       case CURLE_COULDNT_CONNECT:
-        return transfer.wayWasCellular ? WebErrorKind::cellularNotAllowed : WebErrorKind::cannotConnect;
+        return transfer.isOnCellular ? WebErrorKind::cellularNotAllowed : WebErrorKind::cannotConnect;
       case CURLE_OPERATION_TIMEDOUT:
         return WebErrorKind::timedOut;
       case CURLE_GOT_NOTHING:

@@ -21,7 +21,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     whole = head.takeLine(line);
     at = end;
   }
-  if (whole != (size <= ResponseHead::kLargest)) std::abort();
+  if (whole != (size <= ResponseHead::kMaxSize)) std::abort();
   for (const auto& [name, value] : head.fields) {
     // No line of ours can be broken by what a server sent.
     if ((name + value).find('\n') != std::string::npos) std::abort();

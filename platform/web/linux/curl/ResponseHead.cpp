@@ -39,7 +39,7 @@ std::string_view trimmed(std::string_view text) noexcept {
 
 bool ResponseHead::takeLine(std::string_view line) {
   taken_ += line.size();
-  if (taken_ > kLargest) return false;
+  if (taken_ > kMaxSize) return false;
   if (bodyHasBegun_) return true;
   if (line.starts_with("HTTP/")) fields.clear();  // of an interim response before this one
   if (line.starts_with(' ') || line.starts_with('\t')) {

@@ -16,7 +16,7 @@ namespace brenvik {
 class ResponseHead {
  public:
   // Of all lines of one attempt together; a sane server stays far below.
-  static constexpr std::size_t kLargest = std::size_t{256} * 1024;
+  static constexpr std::size_t kMaxSize = std::size_t{256} * 1024;
 
   // False when that is too much. A line that starts a response, after an interim one, starts anew. A line
   // that begins with a blank goes on with the field before it (RFC 9112, 5.2).
