@@ -5,7 +5,7 @@
 #include <cstdint>
 #include <functional>
 
-#include "helper/payload/OutOfLinePayload.h"
+#include "platform/ipc/OutOfLinePayload.h"
 #include "interface/Wire.h"
 #include "platform/ipc/RegionAllocator.h"
 #include "platform/plist/PropertyList.h"
