@@ -69,10 +69,9 @@ TEST_F(RequestAreasTest, ARoutineThatTakesAServerGetsTheOneOfThePortAndWithoutOn
   NoRoutines routines;
   const ServerPlatform platform{
       ports, bootstrap, sources, loop, [](const char*, const AuditToken&) { return true; }, registry};
-  ServerContext server(platform, routines);
-  registry.add(kPort, &server);
-  EXPECT_EQ(areas.call<&withServer>(kPort, arguments), 23);
-  EXPECT_EQ(numbers.server, &server);
+  const auto server = CreateServer(platform, "service", routines);
+  EXPECT_EQ(areas.call<&withServer>(server->servicePort(), arguments), 23);
+  EXPECT_EQ(numbers.server, server.get());
   EXPECT_EQ(numbers.value, -5);
 }
 

@@ -693,8 +693,8 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
 // Keeps its own hold on the send right: the name may be freed while the watch still waits for the hang-up.
 class SocketDeathWatch final : public DeathWatch {
  public:
-  SocketDeathWatch(PortName port, SystemPortSpace::SharedFd end, void* info) noexcept
-      : port_(port), end_(std::move(end)), info_(info) {}
+  SocketDeathWatch(PortName port, SystemPortSpace::SharedFd end) noexcept
+      : port_(port), end_(std::move(end)) {}
 
   bool addTo(RunLoop& loop) {
     source_ = loop.addDescriptor(end_->get(), 0, [this](std::uint32_t events) {
@@ -712,7 +712,6 @@ class SocketDeathWatch final : public DeathWatch {
     callback_ = std::move(callback);
   }
   void invalidate() noexcept override { source_.reset(); }
-  void* info() const noexcept override { return info_; }
 
  private:
   void died() {
@@ -721,7 +720,6 @@ class SocketDeathWatch final : public DeathWatch {
   }
   const PortName port_;
   const SystemPortSpace::SharedFd end_;
-  void* const info_;
   std::function<void(DeathWatch&)> callback_;
   std::unique_ptr<DescriptorSource> source_;
 };
@@ -750,12 +748,11 @@ std::shared_ptr<RoutineSource> SystemPortSources::makeRoutineSource(PortName por
   }
 }
 
-std::shared_ptr<DeathWatch> SystemPortSources::makeDeathWatch(PortName port, RunLoop& loop,
-                                                              void* info) noexcept {
+std::shared_ptr<DeathWatch> SystemPortSources::makeDeathWatch(PortName port, RunLoop& loop) noexcept {
   auto end = ports_.sendEnd(port);
   if (end == nullptr) return nullptr;
   try {
-    auto watch = std::make_shared<SocketDeathWatch>(port, std::move(end), info);
+    auto watch = std::make_shared<SocketDeathWatch>(port, std::move(end));
     if (!watch->addTo(loop)) return nullptr;
     return watch;
   } catch (const std::bad_alloc&) {
