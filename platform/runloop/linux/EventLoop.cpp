@@ -216,27 +216,34 @@ int EventLoop::runOnce(std::uint64_t timeOut) noexcept {
       if (count == -EINTR) return 0;
       if (count < 0) return count;
     }
-    if (count == 0) {
-      // The clock's descriptor may tell a moment later than the clock.
-      if (!hasOwnTasks_) return handleTimer() ? 1 : 0;
-      // Whoever has just got a reply goes first where there is one processor: it waited for that, not for
-      // this.
-      (void)::sched_yield();
-      drainInbox();
-      return 1;
-    }
-    if (ready.data.ptr == clockEntry_) {
-      // A descriptor that is ready at the same moment goes first: a check-in that has arrived beats the idle
-      // countdown. They are all ahead of the clock in the kernel's queue, which has put it at the end: when
-      // it comes round, each has had its turn.
-      if (!std::exchange(clockWasSeenDue_, true)) continue;
-      if (!handleTimer()) continue;
-    } else {
-      descriptors_->handle(static_cast<DescriptorSet::Entry*>(ready.data.ptr), ready.events);
-    }
+    if (count == 0) return handleOwn();
+    if (!handleReady(ready.data.ptr, ready.events)) continue;
     ownTasksAreNext_ = hasOwnTasks_;
     return 1;
   }
+}
+
+// No descriptor is ready: handles what the thread has posted to itself, else the timer that is due. 1 when
+// there was one, 0 when not.
+int EventLoop::handleOwn() noexcept {
+  // The clock's descriptor may tell a moment later than the clock.
+  if (!hasOwnTasks_) return handleTimer() ? 1 : 0;
+  // Whoever has just got a reply goes first where there is one processor: it waited for that, not for this.
+  (void)::sched_yield();
+  drainInbox();
+  return 1;
+}
+
+// Handles what epoll has reported. False when that was nothing yet.
+bool EventLoop::handleReady(void* entry, std::uint32_t events) noexcept {
+  if (entry != clockEntry_) {
+    descriptors_->handle(static_cast<DescriptorSet::Entry*>(entry), events);
+    return true;
+  }
+  // A descriptor that is ready at the same moment goes first: a check-in that has arrived beats the idle
+  // countdown. They are all ahead of the clock in the kernel's queue, which has put it at the end: when it
+  // comes round, each has had its turn.
+  return std::exchange(clockWasSeenDue_, true) && handleTimer();
 }
 
 // Sets the timerfd to the first timer. It is not read: being set makes it unreadable, too.

@@ -72,6 +72,8 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   void drainInbox() noexcept;
   bool makeClock();
   void setClock() noexcept;
+  int handleOwn() noexcept;
+  bool handleReady(void* entry, std::uint32_t events) noexcept;
   bool handleTimer() noexcept;
   bool arm(const std::shared_ptr<Timer>& timer) noexcept;
   void disarm(Timer& timer) noexcept;
