@@ -88,7 +88,7 @@ void prepareProcess() noexcept {
 class Serving {
  public:
   Serving(SystemQueues& queues, SystemRegions& regions, PasswordDatabase& accounts)
-      : queues_(queues), regions_(regions), mobile_(MobileUser::processWide(accounts)) {
+      : queues_(queues), regions_(regions), mobile_(MobileUser::shared(accounts)) {
     LASDUpdater::shared()->configure({.queues = queues_,
                                       .web = web_,
                                       .gunzip = gunzip_,
