@@ -38,7 +38,7 @@ class RecordingAreas {
     integers.clear();
     numbers.clear();
     regions.clear();
-    std::apply([this](auto&... each) { (note(each), ...); }, arguments);
+    std::apply([&](auto&... each) { (note(each), ...); }, arguments);
     (write(results), ...);
     if (whenCalled) whenCalled();
     return answer;
