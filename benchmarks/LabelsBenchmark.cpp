@@ -32,8 +32,8 @@ class BenchmarkTable final : public RoutineTable {
         return Outcome::accepted;
       };
     }
-    return id == kBadges ? &answer<&LabelRoutines::CopyBadgeLabels>
-                         : &answer<&LabelRoutines::CopyLocalizedLabels>;
+    return id == kBadges ? &answer<&LabelRoutines::copyBadgeLabels>
+                         : &answer<&LabelRoutines::copyLocalizedLabels>;
   }
   void* context() const noexcept override { return &routines_; }
 
@@ -145,10 +145,10 @@ void routine(benchmark::State& state, const std::string& labels) {
   }
 }
 void sixNamesRoutine(benchmark::State& state) {
-  routine<&LabelRoutines::CopyLocalizedLabels>(state, sixKeys());
+  routine<&LabelRoutines::copyLocalizedLabels>(state, sixKeys());
 }
 void sixBadgesRoutine(benchmark::State& state) {
-  routine<&LabelRoutines::CopyBadgeLabels>(state, sixPairs());
+  routine<&LabelRoutines::copyBadgeLabels>(state, sixPairs());
 }
 
 BENCHMARK(emptyRoundTrip)->UseRealTime();

@@ -78,16 +78,14 @@ class BenchmarkTable final : public RoutineTable {
     switch (id) {
       case kWanIp:
         return [](void* context, const Request&, Reply& reply) {
-          reply.setStatus(
-              static_cast<LocationRoutines*>(context)->server_BVMobileHelperRequestWanIPFromLocation(1));
+          reply.setStatus(static_cast<LocationRoutines*>(context)->requestWanIPFromLocation(1));
           return Outcome::accepted;
         };
       case kCivicInfo:
         return [](void* context, const Request& request, Reply& reply) {
           const auto& message = request.as<CoordinateRequest>();
-          reply.setStatus(
-              static_cast<LocationRoutines*>(context)->server_BVMobileHelperRequestCountryCodeFromLocation(
-                  1, message.latitude, message.longitude));
+          reply.setStatus(static_cast<LocationRoutines*>(context)->requestCountryCodeFromLocation(
+              1, message.latitude, message.longitude));
           return Outcome::accepted;
         };
       case kOneUnifiedLine:

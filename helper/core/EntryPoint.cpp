@@ -19,20 +19,20 @@ int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const R
   }
 
   int status = 1;
-  ServerContext* server = CreateServer(platform, kServiceName, requests);
+  auto server = CreateServer(platform, kServiceName, requests);
   if (server != nullptr && hosted != nullptr) {
     try {
-      SetIdleCheck(server, [hosted] { return hosted->isBusy(); });
+      SetIdleCheck(server.get(), [hosted] { return hosted->isBusy(); });
     } catch (const std::bad_alloc&) {
       // Without the check a busy hosted server would be ended; not serving at all says what is wrong.
-      DestroyServer(std::exchange(server, nullptr));
+      DestroyServer(std::move(server));
     }
   }
   if (server != nullptr) {
     if (beginWork) beginWork(*server);
     RunServer(*server);
     endWork();
-    DestroyServer(server);
+    DestroyServer(std::move(server));
     status = 0;
   }
 

@@ -27,7 +27,7 @@ class EntryPointTest : public testing::Test {
       baseband.record += "run ";
       PortName port = kNullPort;
       const PortName service = sources.routineSources.at(0)->port;
-      ASSERT_EQ(BVMobileHelperCheckIn(registry, platform, service, ports.adoptSendRight(), &port, {}), 0);
+      ASSERT_EQ(BVMobileHelperCheckIn(platform, service, ports.adoptSendRight(), &port, {}), 0);
       sources.deathWatches.at(0)->tellDeath();
       loop.whenRun = [this] { clock.advance(10s); };
     };

@@ -6,7 +6,6 @@
 
 #include <utility>
 
-#include "Helper/Shared/Server/ServerFacts.h"
 #include "helper/lasd/DatabaseTypes.h"
 
 namespace brenvik {
@@ -55,7 +54,7 @@ StatusReport::Event HelperStatus::event(std::string outcome, std::chrono::nanose
 
 StatusReport HelperStatus::report() const {
   StatusReport report;
-  const ServerFacts server = describeServer(sources_.server);
+  const ServerFacts server = sources_.server.facts();
   report.clients = server.clients;
   for (const auto& [reason, tokens] : server.busyTokens) {
     report.busy.push_back({reason, tokens});

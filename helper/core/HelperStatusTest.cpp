@@ -3,7 +3,10 @@
 #include "helper/core/HelperStatus.h"
 
 #include <gtest/gtest.h>
+
 #include <unistd.h>
+#include <future>
+#include <memory>
 
 #include "platform/ipc/fakes/FakePorts.h"
 #include "platform/log/fakes/RecordingLog.h"
@@ -16,12 +19,9 @@ using namespace std::chrono_literals;
 
 class HelperStatusTest : public testing::Test {
  protected:
-  ~HelperStatusTest() override { DestroyServer(server); }
-
   void clientComes() {
     PortName port = kNullPort;
-    ASSERT_EQ(
-        BVMobileHelperCheckIn(registry, platform, server->servicePort, ports.adoptSendRight(), &port, {}), 0);
+    ASSERT_EQ(BVMobileHelperCheckIn(platform, server->servicePort(), ports.adoptSendRight(), &port, {}), 0);
   }
   void clientGoes() { sources.deathWatches.back()->tellDeath(); }
 
@@ -40,7 +40,7 @@ class HelperStatusTest : public testing::Test {
                           .now = [this] { return clock.now(); }};
   NoRoutines routines;
   RecordingLog log;
-  ServerContext* server = CreateServer(platform, kServiceName, routines);
+  std::unique_ptr<ServerContext> server = CreateServer(platform, kServiceName, routines);
   std::shared_ptr<LASDUpdater> lasd = std::make_shared<LASDUpdater>();
   CellularHeartbeat heartbeat;
   GeoRequestState location;
@@ -93,7 +93,7 @@ TEST_F(HelperStatusTest, ClientsTokensAndTheCountdownAreTold) {
 }
 
 TEST_F(HelperStatusTest, AHostedServerThatIsBusyIsNamedAndTheCountdownBeginsAnew) {
-  SetIdleCheck(server, [] { return true; });
+  SetIdleCheck(server.get(), [] { return true; });
   clientComes();
   clientGoes();
   EXPECT_FALSE(status.report().isKeptByBaseband);
@@ -124,7 +124,7 @@ TEST_F(HelperStatusTest, WorkersAreToldAsTheyAre) {
 }
 
 TEST_F(HelperStatusTest, EveryChangeIsToldWithNoLockHeld) {
-  DestroyServer(server);
+  DestroyServer(std::move(server));
   int changes = 0;
   ServerPlatform listening{.ports = ports,
                            .bootstrap = bootstrap,
@@ -135,13 +135,12 @@ TEST_F(HelperStatusTest, EveryChangeIsToldWithNoLockHeld) {
                            .onChange =
                                [&] {
                                  ++changes;
-                                 EXPECT_TRUE(server->lock.try_lock());
-                                 server->lock.unlock();
+                                 const auto facts = std::async([&] { return server->facts(); });
+                                 EXPECT_EQ(facts.wait_for(10s), std::future_status::ready);
                                }};
   server = CreateServer(listening, kServiceName, routines);
   PortName port = kNullPort;
-  ASSERT_EQ(
-      BVMobileHelperCheckIn(registry, listening, server->servicePort, ports.adoptSendRight(), &port, {}), 0);
+  ASSERT_EQ(BVMobileHelperCheckIn(listening, server->servicePort(), ports.adoptSendRight(), &port, {}), 0);
   EXPECT_EQ(changes, 1);
   clientGoes();
   EXPECT_EQ(changes, 2);
@@ -149,7 +148,7 @@ TEST_F(HelperStatusTest, EveryChangeIsToldWithNoLockHeld) {
   EXPECT_EQ(changes, 3);
   (void)ReleaseBusyToken(*server, token);
   EXPECT_EQ(changes, 4);
-  DestroyServer(std::exchange(server, nullptr));
+  DestroyServer(std::move(server));
 }
 
 }  // namespace

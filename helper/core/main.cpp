@@ -19,9 +19,7 @@
 #include "helper/carrier/FileSystemManager.h"
 #include "helper/carrier/PathPolicy.h"
 #include "helper/core/EntryPoint.h"
-#include "helper/core/HelperRoutines.h"
 #include "helper/core/HelperStatus.h"
-#include "helper/core/RequestsOnFirstUse.h"
 #include "helper/core/StatusLine.h"
 #include "helper/entitlement/EntitlementCheck.h"
 #include "helper/location/GeoRequestState.h"
@@ -86,11 +84,11 @@ void prepareProcess() noexcept {
   (void)::umask(022);
 }
 
-// What serves the requests, and the platform below it that only requests need.
-class Areas {
+// What serves the requests: the areas, and the platform below them that only requests need.
+class Serving {
  public:
-  Areas(SystemQueues& queues, SystemRegions& regions, PasswordDatabase& accounts)
-      : queues_(queues), regions_(regions), mobile_(MobileUser::processWide(accounts)) {
+  Serving(SystemQueues& queues, SystemRegions& regions, PasswordDatabase& accounts)
+      : queues_(queues), regions_(regions), mobile_(MobileUser::shared(accounts)) {
     LASDUpdater::shared()->configure({.queues = queues_,
                                       .web = web_,
                                       .gunzip = gunzip_,
@@ -98,10 +96,10 @@ class Areas {
                                       .messagePorts = messagePorts_});
     CellularHeartbeat::shared().configure({.queues = queues_, .network = echoNetwork_});
   }
-  Areas(const Areas&) = delete;
-  Areas& operator=(const Areas&) = delete;
+  Serving(const Serving&) = delete;
+  Serving& operator=(const Serving&) = delete;
 
-  const RequestTable& requests() const noexcept { return requests_; }
+  RequestAreas& areas() noexcept { return areas_; }
 
   // Processes that work for this one.
   std::vector<StatusReport::Worker> workers() const {
@@ -168,16 +166,16 @@ class Areas {
   ChannelTelephonyDaemon telephonyDaemon_{BRENVIK_BOOTSTRAP_DIRECTORY};
   LocationRoutines location_{queues_, geoService_, telephonyDaemon_, GeoRequestState::shared()};
 
-  HelperRoutines routines_{{.preferences = preferenceTransfer_,
-                            .carrier = carrier_,
-                            .voicemail = voicemail_,
-                            .location = location_,
-                            .radioLogging = radioLogging_,
-                            .labels = labels_,
-                            .channelRemap = channelRemap_,
-                            .lasd = *LASDUpdater::shared(),
-                            .heartbeat = CellularHeartbeat::shared()}};
-  const RequestTable requests_{routines_};
+  RequestAreas areas_{PortServerRegistry::shared(),
+                      preferenceTransfer_,
+                      carrier_,
+                      voicemail_,
+                      location_,
+                      radioLogging_,
+                      labels_,
+                      channelRemap_,
+                      *LASDUpdater::shared(),
+                      CellularHeartbeat::shared()};
 };
 
 // What the process tells about itself: at its status socket, and to the service manager in one line. Both
@@ -249,13 +247,17 @@ int run() {
   SystemBootstrap bootstrap(ports, BRENVIK_BOOTSTRAP_DIRECTORY, BRENVIK_SERVICE_GROUP);
   LoadedBasebandLibrary baseband;
 
-  RequestsOnFirstUse<Areas> requests([&] { return std::make_unique<Areas>(queues, regions, accounts); });
+  std::unique_ptr<Serving> serving;
+  const RequestTable<> requests([&] {
+    serving = std::make_unique<Serving>(queues, regions, accounts);
+    return &serving->areas();
+  });
   const auto describeCaller = [&entitlements](const AuditToken& caller) {
     return entitlements.describe(caller);
   };
-  Telling telling(ports, *loop, queues, [&requests] {
-    return requests.areas() != nullptr ? requests.areas()->workers()
-                                       : std::vector<StatusReport::Worker>{{"network"}, {"stores"}};
+  Telling telling(ports, *loop, queues, [&serving] {
+    return serving != nullptr ? serving->workers()
+                              : std::vector<StatusReport::Worker>{{"network"}, {"stores"}};
   });
   const ServerPlatform platform{.ports = ports,
                                 .bootstrap = bootstrap,
@@ -268,9 +270,9 @@ int run() {
                                 .idlePeriod = std::chrono::milliseconds(BRENVIK_IDLE_MILLISECONDS),
                                 .describeCaller = describeCaller,
                                 .onChange = [&telling] { telling.changed(); }};
-  const auto endWork = [&telling, &requests] {
+  const auto endWork = [&telling, &serving] {
     telling.end();
-    requests.shutDown();
+    if (serving != nullptr) serving->shutDown();
   };
   return runHelper(baseband, platform, requests, endWork,
                    [&telling](ServerContext& server) { telling.begin(server); });

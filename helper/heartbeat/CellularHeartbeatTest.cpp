@@ -33,10 +33,7 @@ std::vector<std::byte> echoReply(std::uint16_t identifier) {
 
 class CellularHeartbeatTest : public testing::Test {
  protected:
-  CellularHeartbeatTest() {
-    server.runLoop = &loop;
-    heartbeat.configure({queues, network, "203.0.113.9"});
-  }
+  CellularHeartbeatTest() { heartbeat.configure({queues, network, "203.0.113.9"}); }
   ~CellularHeartbeatTest() override { heartbeat.shutDown(); }
 
   void use(std::string address) { heartbeat.configure({queues, network, std::move(address)}); }
@@ -51,7 +48,7 @@ class CellularHeartbeatTest : public testing::Test {
     clock.advance(by);
     runQueue();
   }
-  bool idleTimerRuns() const { return server.idleTimer != nullptr; }
+  bool idleTimerRuns() const { return server.isCountingDown(); }
 
   ManualClock clock;
   ManualRunLoop loop{clock};
@@ -61,9 +58,11 @@ class CellularHeartbeatTest : public testing::Test {
   FakePortSources sources;
   PortServerRegistry registry;
   NoRoutines routines;
-  ServerContext server{ServerPlatform{ports, bootstrap, sources, loop,
-                                      [](const char*, const AuditToken&) { return true; }, registry},
-                       routines};
+  const std::unique_ptr<ServerContext> owned =
+      CreateServer(ServerPlatform{ports, bootstrap, sources, loop,
+                                  [](const char*, const AuditToken&) { return true; }, registry},
+                   kServiceName, routines);
+  ServerContext& server = *owned;
   FakeEchoNetwork network;
   RecordingLog log;
   CellularHeartbeat heartbeat;
@@ -269,10 +268,10 @@ TEST_F(CellularHeartbeatTest, SwitchingReturnsAtOnceAndTheWorkIsDoneOnItsOwnQueu
   ASSERT_EQ(queues.serial.size(), 1U);
   EXPECT_EQ(queues.serial[0]->label(), "com.norvale.otaheartbeat");
   EXPECT_TRUE(network.opened.empty());
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
   runQueue();
   EXPECT_EQ(network.sent.size(), 1U) << "one probe within start itself";
-  EXPECT_EQ(server.busyMask, 1U);
+  EXPECT_EQ(server.busyMask(), 1U);
   heartbeat.setHeartbeat(server, false);
   EXPECT_EQ(queues.serial.size(), 1U);
 }
@@ -294,11 +293,11 @@ TEST_F(CellularHeartbeatTest, OneProbeAtStartOneAtTheFirstFiringThenEveryTwoSeco
 TEST_F(CellularHeartbeatTest, ItHoldsABusyTokenUntilItIsSwitchedOff) {
   heartbeat.setHeartbeat(server, true);
   runQueue();
-  EXPECT_EQ(server.busyMask, 1U);
+  EXPECT_EQ(server.busyMask(), 1U);
   EXPECT_FALSE(idleTimerRuns());
   heartbeat.setHeartbeat(server, false);
   runQueue();
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
   EXPECT_TRUE(idleTimerRuns()) << "no client and no token: the countdown begins";
   const auto probes = network.sent.size();
   advance(9s);
@@ -309,16 +308,16 @@ TEST_F(CellularHeartbeatTest, StartedTwiceTheFirstTokenStaysHeld) {
   heartbeat.setHeartbeat(server, true);
   heartbeat.setHeartbeat(server, true);
   runQueue();
-  EXPECT_EQ(server.busyMask, 3U);
+  EXPECT_EQ(server.busyMask(), 3U);
   advance(0s);
   EXPECT_EQ(network.sent.size(), 3U) << "two starts, and one timer only";
   heartbeat.setHeartbeat(server, false);
   runQueue();
-  EXPECT_EQ(server.busyMask, 1U);
+  EXPECT_EQ(server.busyMask(), 1U);
   EXPECT_FALSE(idleTimerRuns());
   heartbeat.setHeartbeat(server, false);
   runQueue();
-  EXPECT_EQ(server.busyMask, 1U) << "a second stop has only token 0 to give";
+  EXPECT_EQ(server.busyMask(), 1U) << "a second stop has only token 0 to give";
 }
 
 TEST_F(CellularHeartbeatTest, WithoutATimerThatCanBeMadeOrArmedItIsOffAndHoldsNoToken) {
@@ -329,7 +328,7 @@ TEST_F(CellularHeartbeatTest, WithoutATimerThatCanBeMadeOrArmedItIsOffAndHoldsNo
     heartbeat.setHeartbeat(server, true);
     queues.serial.at(0)->timers = timers;
     runQueue();
-    EXPECT_EQ(server.busyMask, 0U);
+    EXPECT_EQ(server.busyMask(), 0U);
     EXPECT_EQ(log.entries(), off);
     const auto probes = network.sent.size();
     advance(8s);
@@ -339,17 +338,17 @@ TEST_F(CellularHeartbeatTest, WithoutATimerThatCanBeMadeOrArmedItIsOffAndHoldsNo
   queues.serial[0]->timers = ManualWorkQueue::Timers::work;
   heartbeat.setHeartbeat(server, true);
   runQueue();
-  EXPECT_EQ(server.busyMask, 1U);
+  EXPECT_EQ(server.busyMask(), 1U);
 }
 
 TEST_F(CellularHeartbeatTest, ARunningHeartbeatWhoseNewTimerCannotBeMadeGivesItsTokenBackToo) {
   heartbeat.setHeartbeat(server, true);
   runQueue();
-  ASSERT_EQ(server.busyMask, 1U);
+  ASSERT_EQ(server.busyMask(), 1U);
   queues.serial[0]->timers = ManualWorkQueue::Timers::cannotBeMade;
   heartbeat.setHeartbeat(server, true);
   runQueue();
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
   EXPECT_EQ(log.entries().size(), 1U);
 }
 
@@ -363,7 +362,7 @@ TEST_F(CellularHeartbeatTest, StopWithoutAPriorStartReleasesToken0WhichIsRefused
   const std::uint32_t other = AcquireBusyToken(server);
   heartbeat.setHeartbeat(server, false);
   runQueue();
-  EXPECT_EQ(server.busyMask, other);
+  EXPECT_EQ(server.busyMask(), other);
   ReleaseBusyToken(server, other);
   EXPECT_TRUE(idleTimerRuns());
 }
@@ -384,7 +383,7 @@ TEST_F(CellularHeartbeatTest, FailuresEndSingleProbesOnlyAndNothingIsLogged) {
   network.refuseSockets = false;
   advance(2s);
   EXPECT_EQ(network.sent.size(), 1U);
-  EXPECT_EQ(server.busyMask, 1U);
+  EXPECT_EQ(server.busyMask(), 1U);
   EXPECT_TRUE(log.entries().empty());
 }
 

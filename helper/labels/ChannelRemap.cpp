@@ -27,7 +27,7 @@ std::array<char, kFieldSize + 1> terminated(const char* field) noexcept {
 
 }  // namespace
 
-KernelReturn ChannelRemap::RemapContactsChannel(const char* from, const char* to,
+KernelReturn ChannelRemap::remapContactsChannel(const char* from, const char* to,
                                                 std::uint8_t* success) noexcept {
   *success = remapChannelIdentifier(terminated(from).data(), terminated(to).data()) ? 1 : 0;
   return kern::success;

@@ -17,7 +17,7 @@ class ChannelRemap {
 
   // `from` and `to` are fields of 64 bytes that need not be terminated. Always kern::success; *success is 1
   // or 0.
-  KernelReturn RemapContactsChannel(const char* from, const char* to, std::uint8_t* success) noexcept;
+  KernelReturn remapContactsChannel(const char* from, const char* to, std::uint8_t* success) noexcept;
 
   // Moves every contact's reference from one channel to the other. The texts are NUL-terminated. Returns true
   // if that was done, and also if the contacts cannot be reached.

@@ -27,7 +27,7 @@ class ChannelRemapTest : public ::testing::Test {
     std::memcpy(fromField.data(), from.data(), from.size());
     std::memcpy(toField.data(), to.data(), to.size());
     std::uint8_t success = 0xAA;
-    EXPECT_EQ(remap.RemapContactsChannel(fromField.data(), toField.data(), &success), kern::success);
+    EXPECT_EQ(remap.remapContactsChannel(fromField.data(), toField.data(), &success), kern::success);
     return success;
   }
   static RecordingLog::Entry line(std::string text) {

@@ -85,7 +85,7 @@ KernelReturn handOver(const PropertyList& result, RegionAllocator& regions, OutO
 
 }  // namespace
 
-KernelReturn LabelRoutines::CopyBadgeLabels(const void* labels, std::uint32_t labelsLength,
+KernelReturn LabelRoutines::copyBadgeLabels(const void* labels, std::uint32_t labelsLength,
                                             const void* languages, std::uint32_t languagesLength,
                                             OutOfLinePayload* payload) noexcept {
   *payload = {};
@@ -102,7 +102,7 @@ KernelReturn LabelRoutines::CopyBadgeLabels(const void* labels, std::uint32_t la
                   });
 }
 
-KernelReturn LabelRoutines::CopyLocalizedLabels(const void* labels, std::uint32_t labelsLength,
+KernelReturn LabelRoutines::copyLocalizedLabels(const void* labels, std::uint32_t labelsLength,
                                                 const void* languages, std::uint32_t languagesLength,
                                                 OutOfLinePayload* payload) noexcept {
   *payload = {};

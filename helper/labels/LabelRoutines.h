@@ -4,7 +4,7 @@
 
 #include <cstdint>
 
-#include "helper/payload/OutOfLinePayload.h"
+#include "platform/ipc/OutOfLinePayload.h"
 #include "platform/ipc/RegionAllocator.h"
 #include "platform/labeler/SubscriptionLabeler.h"
 #include "platform/plist/PropertyList.h"
@@ -25,10 +25,10 @@ class LabelRoutines {
   //
   // Short forms. Labels come in pairs of a key of the vocabulary and a text; the text counts only where the
   // key is empty, and is then a user's own label.
-  KernelReturn CopyBadgeLabels(const void* labels, std::uint32_t labelsLength, const void* languages,
+  KernelReturn copyBadgeLabels(const void* labels, std::uint32_t labelsLength, const void* languages,
                                std::uint32_t languagesLength, OutOfLinePayload* payload) noexcept;
   // Names of predefined labels. Labels are keys of the vocabulary.
-  KernelReturn CopyLocalizedLabels(const void* labels, std::uint32_t labelsLength, const void* languages,
+  KernelReturn copyLocalizedLabels(const void* labels, std::uint32_t labelsLength, const void* languages,
                                    std::uint32_t languagesLength, OutOfLinePayload* payload) noexcept;
 
   // The labeler's answers to the decoded arrays; no value when there is none.

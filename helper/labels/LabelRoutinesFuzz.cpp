@@ -27,7 +27,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   HeapRegions regions;
   LabelRoutines routines(labeler, regions);
   OutOfLinePayload payload;
-  const auto method = badges ? &LabelRoutines::CopyBadgeLabels : &LabelRoutines::CopyLocalizedLabels;
+  const auto method = badges ? &LabelRoutines::copyBadgeLabels : &LabelRoutines::copyLocalizedLabels;
   const KernelReturn code =
       (routines.*method)(labels.data(), static_cast<std::uint32_t>(labels.size()), languages.data(),
                          static_cast<std::uint32_t>(languages.size()), &payload);

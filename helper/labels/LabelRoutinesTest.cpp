@@ -49,9 +49,9 @@ struct Routine {
   KernelReturn (LabelRoutines::*call)(const void*, std::uint32_t, const void*, std::uint32_t,
                                       OutOfLinePayload*) noexcept;
 };
-constexpr Routine kBadges{"CopyBadgeLabels", "compiling badge labels", &LabelRoutines::CopyBadgeLabels};
+constexpr Routine kBadges{"CopyBadgeLabels", "compiling badge labels", &LabelRoutines::copyBadgeLabels};
 constexpr Routine kNames{"CopyLocalizedLabels", "compiling localized labels",
-                         &LabelRoutines::CopyLocalizedLabels};
+                         &LabelRoutines::copyLocalizedLabels};
 
 class LabelRoutinesTest : public ::testing::TestWithParam<Routine> {
  protected:
@@ -347,7 +347,7 @@ class RealLabelsTest : public ::testing::Test {
     const std::string labelBytes = bytesOf(labels);
     const std::string languageBytes = bytesOf(languages);
     OutOfLinePayload payload;
-    const auto method = badges ? &LabelRoutines::CopyBadgeLabels : &LabelRoutines::CopyLocalizedLabels;
+    const auto method = badges ? &LabelRoutines::copyBadgeLabels : &LabelRoutines::copyLocalizedLabels;
     EXPECT_EQ(
         (routines.*method)(labelBytes.data(), static_cast<std::uint32_t>(labelBytes.size()),
                            languageBytes.data(), static_cast<std::uint32_t>(languageBytes.size()), &payload),

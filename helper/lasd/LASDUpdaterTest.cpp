@@ -33,7 +33,6 @@ class LASDUpdaterTest : public LasdTest {
   void SetUp() override {
     LasdTest::SetUp();
     directory = folder / "LASD";
-    server.runLoop = &loop;
     updater->configure({queues, web, gunzip, preferences, messagePorts, kManifest, directory, roomyDisk});
   }
   void TearDown() override {
@@ -113,9 +112,11 @@ class LASDUpdaterTest : public LasdTest {
   FakePortSources sources;
   PortServerRegistry registry;
   NoRoutines routines;
-  ServerContext server{ServerPlatform{ports, bootstrap, sources, loop,
-                                      [](const char*, const AuditToken&) { return true; }, registry},
-                       routines};
+  const std::unique_ptr<ServerContext> owned =
+      CreateServer(ServerPlatform{ports, bootstrap, sources, loop,
+                                  [](const char*, const AuditToken&) { return true; }, registry},
+                   kServiceName, routines);
+  ServerContext& server = *owned;
   std::filesystem::path directory;
   InMemoryPreferences preferences;
   RecordingMessagePorts messagePorts;
@@ -136,7 +137,7 @@ TEST_F(LASDUpdaterTest, OnAFirstRunWithoutPreferencesEverythingTheManifestListsI
     EXPECT_EQ(contentOf(directory / (std::string(name) + ".db")), std::string(name) + " 1.0");
     EXPECT_EQ(local(name), record("1.0", urlOf(name)));
   }
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
   for (const auto& seen : web.seen()) EXPECT_FALSE(seen.cellularAllowed);
 }
 
@@ -233,17 +234,17 @@ TEST_F(LASDUpdaterTest, TheRequestReturnsAtOnceAndTheWorkIsDoneOnTheUpdatersQueu
   EXPECT_EQ(log.entries(), Lines{info("Trying to see if update available for mask abcdef")});
   ASSERT_NE(queues.updater, nullptr);
   EXPECT_EQ(queues.updater->label(), "LASDUpdater");
-  EXPECT_EQ(server.busyMask, 1U);
+  EXPECT_EQ(server.busyMask(), 1U);
   EXPECT_TRUE(web.seen().empty());
   queues.updater->runReady();
-  EXPECT_EQ(server.busyMask, 0U);
-  EXPECT_NE(server.idleTimer, nullptr) << "no client and no token: the countdown begins";
+  EXPECT_EQ(server.busyMask(), 0U);
+  EXPECT_TRUE(server.isCountingDown()) << "no client and no token: the countdown begins";
 }
 
 TEST_F(LASDUpdaterTest, ACheckThatFindsNoQueueLeavesNoTokenBehind) {
   queues.refuseQueues = true;
   EXPECT_THROW(updater->checkForUpdate(server, 1), std::bad_alloc);
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
 }
 
 // Takes no memory, which the check must have for itself, and remembers whether it was given up.
@@ -279,7 +280,7 @@ TEST_F(LASDUpdaterTest, AManifestThatCannotBeReadForLackOfMemoryIsNotTakenForNot
       queues.updater->runReady();
       anyFailed = FailingAllocations::failures() > 0;
     }
-    EXPECT_EQ(server.busyMask, 0U) << number;
+    EXPECT_EQ(server.busyMask(), 0U) << number;
     if (shortLog.isGivenUp) {
       ++givenUp;
       ASSERT_EQ(notifications().size(), before + 1) << number;
@@ -312,7 +313,7 @@ TEST_F(LASDUpdaterTest, ADatabaseWithoutAQueueToFetchWithDoesNotEndTheCheck) {
   check(gsm | lte);
   EXPECT_EQ(notifications(), (std::vector<std::string>{"UpdateFailed", "UpdateAvailable lte"}));
   EXPECT_TRUE(logged(error("Update of the gsm database given up: out of memory")));
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
 }
 
 TEST_F(LASDUpdaterTest, OfTheManifestOnlyTheEntryIsKept) {
@@ -364,7 +365,7 @@ TEST_F(LASDUpdaterTest, AManifestThatCannotBeFetchedYieldsExactlyOneUpdateFailed
   check(kAll);
   EXPECT_EQ(notifications(), std::vector<std::string>{"UpdateFailed"});
   EXPECT_TRUE(logged(error("Could not fetch data from source " + kManifest)));
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
 }
 
 TEST_F(LASDUpdaterTest, AnEmptyManifestIsAFailedFetch) {
@@ -425,7 +426,7 @@ TEST_F(LASDUpdaterTest, AnUpdateWithoutAUrlTellsNobody) {
   EXPECT_TRUE(logged(error("URL for umts database is empty")));
   EXPECT_TRUE(logged(error("Could not find lte database URL")));
   EXPECT_EQ(fetched(), std::vector<std::string>{kManifest});
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
 }
 
 TEST_F(LASDUpdaterTest, UpdatingATypeThatWasNeverLookedAtFindsNoUrl) {
@@ -450,7 +451,7 @@ TEST_F(LASDUpdaterTest, WithTheTelephonyDaemonAbsentACheckCompletesNormally) {
   serveAll("1.0");
   check(kAll);
   EXPECT_TRUE(local("scdma"));
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
 }
 
 TEST_F(LASDUpdaterTest, ServerEntriesOfAnEarlierCheckAreReplacedBeforeUse) {
@@ -487,12 +488,12 @@ TEST_F(LASDUpdaterTest, AStalledDownloadHoldsTheProcessWithoutAnyClient) {
   web.holdAnswers();
   std::thread checking([&] { queues.updater->runReady(); });
   while (web.seen().empty()) std::this_thread::yield();
-  EXPECT_EQ(server.busyMask, 1U);
-  EXPECT_EQ(server.idleTimer, nullptr);
+  EXPECT_EQ(server.busyMask(), 1U);
+  EXPECT_FALSE(server.isCountingDown());
   web.releaseAnswers();
   checking.join();
-  EXPECT_EQ(server.busyMask, 0U);
-  EXPECT_NE(server.idleTimer, nullptr);
+  EXPECT_EQ(server.busyMask(), 0U);
+  EXPECT_TRUE(server.isCountingDown());
 }
 
 TEST_F(LASDUpdaterTest, EachInstallHasABusyTokenOfItsOwn) {
@@ -501,7 +502,7 @@ TEST_F(LASDUpdaterTest, EachInstallHasABusyTokenOfItsOwn) {
    public:
     explicit Watching(ServerContext& context) : server_(context) {}
     std::unique_ptr<RemoteMessagePort> openRemote(const std::string&) noexcept override {
-      masks.push_back(server_.busyMask);
+      masks.push_back(server_.busyMask());
       return nullptr;
     }
     std::vector<std::uint32_t> masks;
@@ -523,14 +524,14 @@ TEST_F(LASDUpdaterTest, WithoutMemoryForARequestOrAQueueACheckFailsAndGivesItsTo
   check(kAll);
   EXPECT_EQ(notifications(), std::vector<std::string>{"UpdateFailed"});
   EXPECT_TRUE(logged(error("Cannot create HTTP request for URL " + kManifest)));
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
   web.exhausted = false;
   log.clear();
   queues.refuseQueues = true;
   check(kAll);
   EXPECT_TRUE(logged(error("Update check given up: out of memory")));
   EXPECT_EQ(notifications(), (std::vector<std::string>{"UpdateFailed", "UpdateFailed"}));
-  EXPECT_EQ(server.busyMask, 0U);
+  EXPECT_EQ(server.busyMask(), 0U);
   queues.refuseQueues = false;
   check(gsm);
   EXPECT_EQ(notifications().back(), "UpdateAvailable gsm");
@@ -540,7 +541,7 @@ TEST_F(LASDUpdaterTest, ChecksRunOneAfterTheOther) {
   serveAll("1.0");
   updater->checkForUpdate(server, gsm);
   updater->checkForUpdate(server, gsm | umts);
-  EXPECT_EQ(server.busyMask, 3U);
+  EXPECT_EQ(server.busyMask(), 3U);
   queues.updater->runReady();
   EXPECT_EQ(notifications(), (std::vector<std::string>{"UpdateAvailable gsm", "UpdateAvailable umts"}));
 }

@@ -26,14 +26,13 @@ LocationRoutines::LocationRoutines(WorkQueues& queues, GeoService& geoService,
 
 LocationRoutines::~LocationRoutines() { requests_->close(); }
 
-KernelReturn LocationRoutines::server_BVMobileHelperRequestCountryCodeFromLocation(PortName, double latitude,
-                                                                                   double longitude) {
+KernelReturn LocationRoutines::requestCountryCodeFromLocation(PortName, double latitude, double longitude) {
   logBsd(SyslogPriority::error, "server_BVMobileHelperRequestCountryCodeFromLocation \n");
   dispatchCivicInfoRequest(latitude, longitude);
   return kern::success;
 }
 
-KernelReturn LocationRoutines::server_BVMobileHelperCopyCountryCode(PortName, char* countryCode) {
+KernelReturn LocationRoutines::copyCountryCode(PortName, char* countryCode) {
   const std::string text = requests_->currentCountryCode();
   // As strncpy does it: the rest is NUL, and a text that fills the field is cut without one.
   std::memset(countryCode, 0, kCountryCodeField);
@@ -41,7 +40,7 @@ KernelReturn LocationRoutines::server_BVMobileHelperCopyCountryCode(PortName, ch
   return kern::success;
 }
 
-KernelReturn LocationRoutines::server_BVMobileHelperRequestWanIPFromLocation(PortName) {
+KernelReturn LocationRoutines::requestWanIPFromLocation(PortName) {
   logUnified(LogLevel::debug, "server_BVMobileHelperRequestWanIPFromLocation");
   dispatchWanIpRequest();
   return kern::success;

@@ -28,12 +28,11 @@ class LocationRoutines {
   ~LocationRoutines();
 
   // 8683567: push the civic address of the coordinate (degrees). Always succeeds.
-  KernelReturn server_BVMobileHelperRequestCountryCodeFromLocation(PortName port, double latitude,
-                                                                   double longitude);
+  KernelReturn requestCountryCodeFromLocation(PortName port, double latitude, double longitude);
   // 8683568: the current country code; all 64 bytes are written, and a text that fills them has no NUL.
-  KernelReturn server_BVMobileHelperCopyCountryCode(PortName port, char* countryCode);
+  KernelReturn copyCountryCode(PortName port, char* countryCode);
   // 8683569: push the address under which this device is seen from outside. Always succeeds.
-  KernelReturn server_BVMobileHelperRequestWanIPFromLocation(PortName port);
+  KernelReturn requestWanIPFromLocation(PortName port);
 
  private:
   // noexcept: a request that cannot be queued ends the process.

@@ -57,9 +57,9 @@ class LocationRoutinesTest : public testing::Test {
   LocationRoutinesTest() { geo.countryCode = "NO"; }
 
   KernelReturn askCivicInfo(double latitude = 48.8584, double longitude = 2.2945) {
-    return routines->server_BVMobileHelperRequestCountryCodeFromLocation(kPort, latitude, longitude);
+    return routines->requestCountryCodeFromLocation(kPort, latitude, longitude);
   }
-  KernelReturn askWanIp() { return routines->server_BVMobileHelperRequestWanIPFromLocation(kPort); }
+  KernelReturn askWanIp() { return routines->requestWanIPFromLocation(kPort); }
 
   ManualWorkQueue& geoQueue() { return *queues.serial.at(0); }
   // Lets both queues work until neither has anything left.
@@ -89,7 +89,7 @@ class LocationRoutinesTest : public testing::Test {
 
 TEST_F(LocationRoutinesTest, NoQueueIsMadeBeforeTheFirstGeoRequest) {
   std::array<char, 64> code{};
-  routines->server_BVMobileHelperCopyCountryCode(kPort, code.data());
+  routines->copyCountryCode(kPort, code.data());
   EXPECT_TRUE(queues.serial.empty());
 }
 
@@ -102,7 +102,7 @@ TEST_F(LocationRoutinesTest, AllRequestsShareOneUtilityQueueMadeOnce) {
   EXPECT_EQ(geoQueue().label(), "GEO callback queue");
   EXPECT_EQ(geoQueue().qualityOfService(), QualityOfService::utility);
   LocationRoutines second(queues, geo, brenvik, state);
-  second.server_BVMobileHelperRequestWanIPFromLocation(kPort);
+  second.requestWanIPFromLocation(kPort);
   EXPECT_EQ(queues.serial.size(), 1U);
 }
 
@@ -344,8 +344,8 @@ TEST_F(LocationRoutinesTest, AnExceptionWhileQueueingARequestEndsTheProcess) {
   GeoRequestState fresh;
   LocationRoutines starved(none, geo, brenvik, fresh);
   testing::FLAGS_gtest_death_test_style = "threadsafe";
-  EXPECT_DEATH(starved.server_BVMobileHelperRequestWanIPFromLocation(kPort), "");
-  EXPECT_DEATH(starved.server_BVMobileHelperRequestCountryCodeFromLocation(kPort, 1, 1), "");
+  EXPECT_DEATH(starved.requestWanIPFromLocation(kPort), "");
+  EXPECT_DEATH(starved.requestCountryCodeFromLocation(kPort, 1, 1), "");
 }
 
 // ---- civic info -------------------------------------------------------------------------------------------
@@ -620,7 +620,7 @@ TEST_F(LocationRoutinesTest, NoCountryCodeIsABufferOfNulsAndOneErrorLine) {
   geo.countryCode.reset();
   std::array<char, 64> reply;
   reply.fill('x');
-  EXPECT_EQ(routines->server_BVMobileHelperCopyCountryCode(kPort, reply.data()), kern::success);
+  EXPECT_EQ(routines->copyCountryCode(kPort, reply.data()), kern::success);
   EXPECT_EQ(reply, (std::array<char, 64>{}));
   EXPECT_EQ(log.entries(), Lines{kNoCountryCode});
 }
@@ -628,7 +628,7 @@ TEST_F(LocationRoutinesTest, NoCountryCodeIsABufferOfNulsAndOneErrorLine) {
 TEST_F(LocationRoutinesTest, ATwoLetterCountryCodeIsFollowedBySixtyTwoNuls) {
   std::array<char, 64> reply;
   reply.fill('x');
-  EXPECT_EQ(routines->server_BVMobileHelperCopyCountryCode(kPort, reply.data()), kern::success);
+  EXPECT_EQ(routines->copyCountryCode(kPort, reply.data()), kern::success);
   EXPECT_EQ(reply, (std::array<char, 64>{'N', 'O'}));
   EXPECT_EQ(log.entries(), Lines{});
 }
@@ -638,7 +638,7 @@ TEST_F(LocationRoutinesTest, ACountryCodeOfSixtyFourBytesOrMoreIsCutWithoutTermi
     geo.countryCode = std::string(length, 'A');
     std::array<char, 66> reply;
     reply.fill('x');
-    EXPECT_EQ(routines->server_BVMobileHelperCopyCountryCode(kPort, reply.data()), kern::success);
+    EXPECT_EQ(routines->copyCountryCode(kPort, reply.data()), kern::success);
     const std::size_t kept = std::min<std::size_t>(length, 64);
     EXPECT_EQ(std::string(reply.data(), 66), std::string(kept, 'A') + std::string(64 - kept, '\0') + "xx")
         << length;
@@ -649,7 +649,7 @@ TEST_F(LocationRoutinesTest, ACountryCodeEndsAtItsFirstNul) {
   geo.countryCode = std::string("NO\0SE", 5);
   std::array<char, 64> reply;
   reply.fill('x');
-  routines->server_BVMobileHelperCopyCountryCode(kPort, reply.data());
+  routines->copyCountryCode(kPort, reply.data());
   EXPECT_EQ(reply, (std::array<char, 64>{'N', 'O'}));
 }
 

@@ -20,10 +20,10 @@ MobileUser::~MobileUser() {
   if (homeDirectory_ != nullptr) allocator_.deallocate(homeDirectory_);
 }
 
-MobileUser& MobileUser::processWide(AccountDirectory& accounts) {
+MobileUser& MobileUser::shared(AccountDirectory& accounts) {
   // Work queues may still ask for it while static objects are being destroyed.
-  static MobileUser& shared = *new MobileUser(accounts);
-  return shared;
+  static MobileUser& user = *new MobileUser(accounts);
+  return user;
 }
 
 const char* MobileUser::homeDirectory() {

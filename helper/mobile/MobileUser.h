@@ -32,7 +32,7 @@ class MobileUser {
   gid_t gid();
 
   // The process's one object, made on first use with the directory of that first call and never destroyed.
-  static MobileUser& processWide(AccountDirectory& accounts);
+  static MobileUser& shared(AccountDirectory& accounts);
 
  private:
   void fillOnce();

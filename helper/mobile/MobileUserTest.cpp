@@ -120,8 +120,8 @@ TEST(MobileUserTest, TheProcessHasOneObjectWhoeverAsks) {
   static FakeAccountDirectory first;  // as long-lived as the object that keeps a reference to it
   first.accounts["mobile"] = {AccountIds{501, 502}, "/var/mobile"};
   FakeAccountDirectory second;
-  MobileUser& user = MobileUser::processWide(first);
-  EXPECT_EQ(&MobileUser::processWide(second), &user);
+  MobileUser& user = MobileUser::shared(first);
+  EXPECT_EQ(&MobileUser::shared(second), &user);
   EXPECT_EQ(user.uid(), 501U);
   EXPECT_EQ(second.idLookUps, 0);
 }

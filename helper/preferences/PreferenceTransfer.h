@@ -5,8 +5,8 @@
 #include <cstdint>
 #include <functional>
 
-#include "helper/payload/OutOfLinePayload.h"
 #include "interface/Wire.h"
+#include "platform/ipc/OutOfLinePayload.h"
 #include "platform/ipc/RegionAllocator.h"
 #include "platform/plist/PropertyList.h"
 #include "platform/preferences/PreferencesStore.h"

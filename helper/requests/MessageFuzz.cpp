@@ -15,7 +15,7 @@
 #include <vector>
 
 #include "helper/requests/RequestTable.h"
-#include "helper/requests/fakes/RecordingRoutines.h"
+#include "helper/requests/fakes/RecordingAreas.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/runloop/linux/SystemQueues.h"
@@ -41,8 +41,8 @@ struct Server {
   SystemPortSpace ports;
   SystemRegions regions;
   SystemPortSources sources{ports, regions};
-  RecordingRoutines routines;
-  RequestTable table{routines};
+  RecordingAreas areas;
+  RequestTable<RecordingAreas> table{[this] { return &areas; }};
   PortName port = kNullPort;
   std::shared_ptr<RoutineSource> source;
   UniqueFd client;
@@ -50,7 +50,7 @@ struct Server {
   UniqueFd unsealed = memfd(0);
 
   Server() {
-    routines.payload = {};  // its bytes are no region of ours
+    areas.payload = {};  // its bytes are no region of ours
     require(ports.allocateReceiveRight(&port) == kern::success &&
             ports.insertSendRight(port) == kern::success);
     source = sources.makeRoutineSource(port, table, WantTrailer::no);

@@ -5,11 +5,13 @@
 #include <gtest/gtest.h>
 
 #include <array>
+#include <cctype>
 #include <cstring>
+#include <new>
 #include <string>
 #include <vector>
 
-#include "helper/requests/fakes/RecordingRoutines.h"
+#include "helper/requests/fakes/RecordingAreas.h"
 #include "interface/Routines.h"
 #include "platform/log/Log.h"
 #include "platform/log/LogContext.h"
@@ -65,9 +67,9 @@ class RequestTableTest : public testing::Test {
   }
   KernelReturn deliver(const RoutineFacts& facts) { return deliver(facts.id, facts.requestSize); }
   void expectRefusedWith(const RoutineFacts& facts, std::uint32_t size, KernelReturn code) {
-    routines.called.clear();
+    areas.called.clear();
     EXPECT_EQ(deliver(facts.id, size), code) << facts.name << " of " << size << " bytes";
-    EXPECT_EQ(routines.called, "") << facts.name;
+    EXPECT_EQ(areas.called, "") << facts.name;
     EXPECT_EQ(outcome, Outcome::refused);
     const auto& status = *reinterpret_cast<const StatusReply*>(answer);
     EXPECT_EQ(status.header.size, 36U);
@@ -75,8 +77,14 @@ class RequestTableTest : public testing::Test {
     EXPECT_EQ(std::memcmp(&status.ndr, &kNdrRecord, sizeof kNdrRecord), 0);
   }
 
-  RecordingRoutines routines;
-  RequestTable table{routines};
+  RecordingAreas areas;
+  int made = 0;
+  bool isExhausted = false;
+  RequestTable<RecordingAreas> table{[this] {
+    if (isExhausted) throw std::bad_alloc();
+    ++made;
+    return &areas;
+  }};
   Outcome outcome = Outcome::refused;
   alignas(16) std::byte message[4096];
   alignas(16) std::byte answer[512];
@@ -86,8 +94,11 @@ TEST_F(RequestTableTest, EveryRowReachesItsOwnRoutineWithThePortItArrivedOn) {
   for (const auto& facts : kRequestRoutines) {
     makeRequest(facts);
     EXPECT_EQ(deliver(facts), kern::success) << facts.name;
-    EXPECT_EQ("BVMobileHelper" + routines.called, facts.name);
-    EXPECT_EQ(routines.port, kPort);
+    // The routine of the area has the routine's own name, in lowerCamel.
+    std::string name(facts.name.substr(std::strlen("BVMobileHelper")));
+    name[0] = static_cast<char>(std::tolower(static_cast<unsigned char>(name[0])));
+    EXPECT_EQ(areas.called, name);
+    EXPECT_EQ(areas.port, kPort);
     EXPECT_EQ(outcome, Outcome::accepted);
   }
 }
@@ -95,7 +106,7 @@ TEST_F(RequestTableTest, EveryRowReachesItsOwnRoutineWithThePortItArrivedOn) {
 TEST_F(RequestTableTest, LinesOfARoutineCarryItsNameAndTheCallerOfItsPortAndLaterOnesDoNot) {
   RecordingLog log;
   LogCallers::shared().add(kPort, std::make_shared<LogCaller>(LogCaller{9, 0, "/usr/bin/x", ""}));
-  routines.whenCalled = [] { logUnified(LogLevel::info, "line"); };
+  areas.whenCalled = [] { logUnified(LogLevel::info, "line"); };
   for (const auto& facts : kRequestRoutines) {
     makeRequest(facts);
     EXPECT_EQ(deliver(facts), kern::success);
@@ -176,7 +187,7 @@ TEST_F(RequestTableTest, EveryDescriptorMustBeOutOfLineAndAgreeWithItsLengthFiel
 }
 
 TEST_F(RequestTableTest, ARoutinesOwnStatusIsPassedOnInAStatusReplyWhateverTheRowsForm) {
-  routines.answer = 8;
+  areas.answer = 8;
   for (const auto& facts : kRequestRoutines) {
     makeRequest(facts);
     EXPECT_EQ(deliver(facts), 8) << facts.name;
@@ -197,7 +208,7 @@ TEST_F(RequestTableTest, RepliesHaveTheFormOfTheirRow) {
       const auto& reply = *reinterpret_cast<const OutOfLineReply*>(answer);
       EXPECT_EQ(reply.header.bits, kComplexBit | kReplyDisposition);
       EXPECT_EQ(reply.descriptorCount, 1U);
-      EXPECT_EQ(std::uint64_t{reply.payload.address}, reinterpret_cast<std::uint64_t>(routines.region));
+      EXPECT_EQ(std::uint64_t{reply.payload.address}, reinterpret_cast<std::uint64_t>(areas.region));
       EXPECT_EQ(reply.payload.deallocate, 1);
       EXPECT_EQ(reply.payload.copy, 1);
       EXPECT_EQ(reply.payload.pad, 0);
@@ -279,22 +290,24 @@ TEST_F(RequestTableTest, TextsOfEveryRowArriveInOrderFromTheirOffsets) {
       wanted.emplace_back(size, letter);
     }
     deliver(facts);
-    EXPECT_EQ(routines.texts, wanted) << facts.name;
+    EXPECT_EQ(areas.texts, wanted) << facts.name;
   }
 }
 
 TEST_F(RequestTableTest, RegionsNumbersAndCoordinatesArriveFromTheirOffsets) {
+  using Regions = std::vector<std::string>;
+  using Numbers = std::vector<double>;
+  using Integers = std::vector<std::int32_t>;
   makeRequest(kRequestRoutines[6]);
   deliver(kRequestRoutines[6]);
-  EXPECT_EQ(routines.firstRegion, "first");
+  EXPECT_EQ(areas.regions, Regions{"first"});
 
   for (const std::size_t row : {24U, 25U}) {
-    routines.firstRegion.clear();
-    routines.secondRegion.clear();
     makeRequest(kRequestRoutines[row]);
+    descriptor(1).size = 4;
+    write(72, 4);
     deliver(kRequestRoutines[row]);
-    EXPECT_EQ(routines.firstRegion, "first") << row;
-    EXPECT_EQ(routines.secondRegion, "other") << row;
+    EXPECT_EQ(areas.regions, (Regions{"first", "othe"})) << row;
   }
 
   makeRequest(kRequestRoutines[18]);
@@ -303,32 +316,32 @@ TEST_F(RequestTableTest, RegionsNumbersAndCoordinatesArriveFromTheirOffsets) {
   std::memcpy(message + 32, &latitude, 8);
   std::memcpy(message + 40, &longitude, 8);
   deliver(kRequestRoutines[18]);
-  EXPECT_EQ(routines.latitude, latitude);
-  EXPECT_EQ(routines.longitude, longitude);
+  EXPECT_EQ(areas.numbers, (Numbers{latitude, longitude}));
 
   std::int32_t number = -2;
   for (const std::size_t row : {13U, 14U, 21U}) {
     makeRequest(kRequestRoutines[row]);
     write(32, static_cast<std::uint32_t>(number));
     deliver(kRequestRoutines[row]);
-    EXPECT_EQ(routines.integer, number--) << row;
+    EXPECT_EQ(areas.integers, Integers{number--}) << row;
   }
 }
 
 TEST_F(RequestTableTest, TextResultsAreWrittenStraightIntoTheReply) {
-  makeRequest(kRequestRoutines[4]);
-  deliver(kRequestRoutines[4]);
-  EXPECT_EQ(std::string(reinterpret_cast<const char*>(answer) + 36), "a token");
-  makeRequest(kRequestRoutines[5]);
-  deliver(kRequestRoutines[5]);
-  EXPECT_EQ(std::string(reinterpret_cast<const char*>(answer) + 36, 256), std::string(256, 'x'));
-  makeRequest(kRequestRoutines[19]);
-  deliver(kRequestRoutines[19]);
-  EXPECT_EQ(std::string(reinterpret_cast<const char*>(answer) + 36, 64), "NO" + std::string(62, '\0'));
+  for (const auto& [row, size] : {std::pair{4U, 256U}, {5U, 256U}, {19U, 64U}}) {
+    for (const std::string& text : {std::string("a token"), std::string(size, 'x')}) {
+      areas.text = text;
+      makeRequest(kRequestRoutines[row]);
+      deliver(kRequestRoutines[row]);
+      EXPECT_EQ(std::string(reinterpret_cast<const char*>(answer) + 36, size),
+                text + std::string(size - text.size(), '\0'))
+          << row;
+    }
+  }
 }
 
 TEST_F(RequestTableTest, AnEmptyPayloadIsSuccessWithAddressAndLengthZero) {
-  routines.payload = {};
+  areas.payload = {};
   makeRequest(kRequestRoutines[7]);
   ASSERT_EQ(deliver(kRequestRoutines[7]), kern::success);
   const auto& reply = *reinterpret_cast<const OutOfLineReply*>(answer);
@@ -339,10 +352,32 @@ TEST_F(RequestTableTest, AnEmptyPayloadIsSuccessWithAddressAndLengthZero) {
 }
 
 TEST_F(RequestTableTest, APayloadThatAFailedRoutineLeftBehindIsNotSent) {
-  routines.answer = kern::noSpace;
+  areas.answer = kern::noSpace;
   makeRequest(kRequestRoutines[23]);
   EXPECT_EQ(deliver(kRequestRoutines[23]), kern::noSpace);
   for (std::size_t i = 36; i < sizeof answer; ++i) EXPECT_EQ(answer[i], std::byte{0});
+}
+
+// ---- the areas are made with the first request ----
+
+TEST_F(RequestTableTest, TheAreasAreMadeForTheFirstRequestAndOnce) {
+  EXPECT_EQ(table.context(), nullptr);
+  EXPECT_EQ(made, 0);
+  makeRequest(kRequestRoutines[2]);
+  EXPECT_EQ(deliver(kRequestRoutines[2]), kern::success);
+  EXPECT_EQ(deliver(kRequestRoutines[2]), kern::success);
+  EXPECT_EQ(made, 1);
+}
+
+TEST_F(RequestTableTest, WithoutMemoryForTheAreasEveryRequestGets6AndTheNextTriesAgain) {
+  isExhausted = true;
+  makeRequest(kRequestRoutines[2]);
+  expectRefusedWith(kRequestRoutines[2], 24, kern::resourceShortage);
+  EXPECT_EQ(deliver(0, 24), kern::resourceShortage) << "an unknown id, too";
+  isExhausted = false;
+  EXPECT_EQ(deliver(kRequestRoutines[2]), kern::success);
+  EXPECT_EQ(areas.called, "clearVoicemailToken");
+  EXPECT_EQ(made, 1);
 }
 
 }  // namespace

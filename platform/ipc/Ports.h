@@ -13,18 +13,25 @@ namespace brenvik {
 
 // The names of this process's ports and the rights behind them. A name is never 0 or 0xFFFFFFFF and is not
 // handed out again soon after it was freed. Main loop only.
+//
+// A right has references. Whoever makes or adopts one drops it once; platform/ipc/Rights.h has owners that
+// do. Codes, where a member names no others: kern::success; kern::resourceShortage when the process or the
+// system is out of descriptors or memory; kern::invalidName when there is no such port.
 class PortSpace {
  public:
   virtual ~PortSpace() = default;
 
-  // Makes a port with one receive right. resourceShortage when the process or the system is out of
-  // descriptors.
+  // Makes a port with one reference of its receive right, which the caller owns. On failure *name is not
+  // written.
   virtual KernelReturn allocateReceiveRight(PortName* name) noexcept = 0;
-  // Makes a send right to the port from its receive right (make-send).
+  // Makes one reference of a send right to the port from its receive right (make-send). The caller owns it.
+  // kern::invalidRight when the port has no receive right here.
   virtual KernelReturn insertSendRight(PortName name) noexcept = 0;
-  // Drops one reference of the receive right: the port dies, every holder of a send right sees a hang-up.
+  // Drops one reference of the receive right. With the last one the port dies and every holder of a send
+  // right sees a hang-up. kern::invalidRight, or invalidName, when there is no reference: nothing changes.
   virtual KernelReturn dropReceiveRight(PortName name) noexcept = 0;
-  // Drops one reference of a send right.
+  // Drops one reference of a send right. kern::invalidRight, or invalidName, when there is none: nothing
+  // changes.
   virtual KernelReturn deallocateSendRight(PortName name) noexcept = 0;
 };
 
@@ -32,7 +39,9 @@ class PortSpace {
 class Bootstrap {
  public:
   virtual ~Bootstrap() = default;
-  // Obtains the receive right of the named service. noAccess when another live process holds the name.
+  // Obtains the receive right of the named service; the caller owns one reference. kern::noAccess when
+  // another live process holds the name, kern::failure when the service cannot be set up,
+  // kern::resourceShortage without memory. *receiveRight is written on success only.
   virtual KernelReturn checkIn(const char* serviceName, PortName* receiveRight) noexcept = 0;
 };
 
@@ -44,14 +53,17 @@ enum class WantTrailer : bool { no, yes };
 class RoutineSource {
  public:
   virtual ~RoutineSource() = default;
+  // Begins to serve on the loop, which outlives the source. False when the loop cannot watch the port.
   virtual bool addTo(RunLoop& loop) noexcept = 0;
+  // Ends the serving, for good. The port stays.
   virtual void invalidate() noexcept = 0;
 };
 
 // Watches the port behind a send right for its death. Main loop only; may be destroyed from its callback.
 class DeathWatch {
  public:
-  virtual ~DeathWatch() = default;
+  virtual ~DeathWatch() = default;  // invalidates
+  // The send right's name. The watch owns no reference of the right.
   virtual PortName port() const noexcept = 0;
   // False once the port has died or the watch was invalidated.
   virtual bool isValid() const noexcept = 0;
@@ -59,17 +71,16 @@ class DeathWatch {
   // Empty: none. Invalidating the watch runs nothing.
   virtual void setInvalidationCallback(std::function<void(DeathWatch&)> callback) noexcept = 0;
   virtual void invalidate() noexcept = 0;
-  // What its maker gave as `info`.
-  virtual void* info() const noexcept = 0;
 };
 
-// Makes the sources above for ports of one PortSpace. Null where the platform refused.
+// Makes the sources above for ports of one PortSpace. Null when there is no such right, or the platform lacks
+// memory or descriptors. The table and the loop outlive what is made with them.
 class PortSources {
  public:
   virtual ~PortSources() = default;
   virtual std::shared_ptr<RoutineSource> makeRoutineSource(PortName port, const RoutineTable& table,
                                                            WantTrailer trailer) noexcept = 0;
-  virtual std::shared_ptr<DeathWatch> makeDeathWatch(PortName port, RunLoop& loop, void* info) noexcept = 0;
+  virtual std::shared_ptr<DeathWatch> makeDeathWatch(PortName port, RunLoop& loop) noexcept = 0;
 };
 
 }  // namespace brenvik

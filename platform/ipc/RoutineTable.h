@@ -82,9 +82,11 @@ class RoutineTable {
   using Handler = Outcome (*)(void* context, const Request& request, Reply& reply);
 
   virtual ~RoutineTable() = default;
-  // The handler of a message id, or null: the request is then answered as one of unknown id. A handler must
-  // leave a complete reply; it neither throws nor allocates but for a reply's region.
+  // The handler of a message id, or null: the request is then answered as one of unknown id. A handler leaves
+  // a complete reply. It allocates no memory for it but an out-of-line region. When it throws std::bad_alloc,
+  // the source answers with kern::resourceShortage and the request counts as refused.
   virtual Handler find(std::int32_t id) const noexcept = 0;
+  // What the handlers get as `context`. Asked after find().
   virtual void* context() const noexcept = 0;
 };
 

@@ -17,12 +17,29 @@ class LoopSource {
   virtual void invalidate() noexcept = 0;
 };
 
+// What a watcher wants to know of a descriptor. Whatever it is, a hang-up and an error are reported as well.
+enum class Interest : std::uint8_t { none, reading, writing, readingAndWriting };
+
+constexpr Interest interestIn(bool reading, bool writing) noexcept {
+  if (reading) return writing ? Interest::readingAndWriting : Interest::reading;
+  return writing ? Interest::writing : Interest::none;
+}
+
+// What has become of a watched descriptor.
+struct Readiness {
+  bool isReadable = false;
+  bool isWritable = false;
+  bool hasHungUp = false;
+  bool hasFailed = false;
+
+  bool isOver() const noexcept { return hasHungUp || hasFailed; }
+};
+
 // A watched descriptor, whose interest can be changed.
 class DescriptorSource : public LoopSource {
  public:
-  // `events` is a mask of EPOLLIN and EPOLLOUT; EPOLLHUP and EPOLLERR are always reported. False when the
-  // kernel refused. Loop thread only.
-  virtual bool setEvents(std::uint32_t events) noexcept = 0;
+  // False when the kernel refused: then the interest is as before. Loop thread only.
+  virtual bool setInterest(Interest interest) noexcept = 0;
 };
 
 enum class RunResult : std::int32_t {
@@ -38,7 +55,7 @@ enum class ReturnAfterSource : bool { no, yes };
 // Unless a member says otherwise, call it on the loop's own thread only.
 class RunLoop {
  public:
-  using DescriptorHandler = std::function<void(std::uint32_t events)>;
+  using DescriptorHandler = std::function<void(Readiness)>;
 
   virtual ~RunLoop() = default;
 
@@ -50,14 +67,14 @@ class RunLoop {
   virtual void stop() noexcept = 0;
 
   // Watches a descriptor, level-triggered; the descriptor stays the caller's and must outlive the source.
-  // Null when the kernel refused.
-  virtual std::unique_ptr<DescriptorSource> addDescriptor(int fd, std::uint32_t events,
+  // Null when the kernel refused. Throws std::bad_alloc.
+  virtual std::unique_ptr<DescriptorSource> addDescriptor(int fd, Interest interest,
                                                           DescriptorHandler handler) = 0;
 
   // A repeating timer: first after `first`, then every `interval` (zero: once only). Descriptors that are
   // ready at the same moment are served before it. Null when it cannot be made. Any thread, as is the
   // source's destruction; off the loop's thread the timer may still fail to be armed later, and then
-  // `failed` runs on the loop's thread in the handler's place.
+  // `failed` runs on the loop's thread in the handler's place. Throws std::bad_alloc.
   virtual std::unique_ptr<LoopSource> addTimer(std::chrono::nanoseconds first,
                                                std::chrono::nanoseconds interval,
                                                std::function<void()> handler,

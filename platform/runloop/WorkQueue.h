@@ -31,19 +31,23 @@ class WorkQueue {
 
   virtual const std::string& label() const noexcept = 0;
 
+  // Queues the task and returns. A task that throws std::bad_alloc is given up, with a line in the log; it
+  // must throw nothing else. Throws std::bad_alloc (OutOfQueues when the queue's thread cannot be started)
+  // and has then queued nothing.
   virtual void post(Task task) = 0;
 
   // Runs the task once, `delay` from now (a clock that counts while the system sleeps). It cannot be
-  // cancelled.
+  // cancelled. Throws as post() does. When the delay cannot be timed, the task runs at once.
   virtual void postAfter(std::chrono::nanoseconds delay, Task task) = 0;
 
   // A timer whose handler runs on this queue: first after `first`, then every `interval`; a firing may be put
   // off by up to `leeway` so that wake-ups coincide. Ticks that fall while the handler runs become one. The
-  // timer is inactive until activated. Null when it cannot be made.
+  // timer is inactive until activated. Null when it cannot be made. Throws as post() does.
   class Timer {
    public:
     virtual ~Timer() = default;  // cancels
     // False when the system cannot time it, so that it will never fire; off the queue that is not known yet.
+    // Throws std::bad_alloc.
     virtual bool activate() = 0;
     virtual void cancel() noexcept = 0;
   };
@@ -55,7 +59,8 @@ class WorkQueue {
 
   // Watches a descriptor on this queue, level-triggered: for drivers of libraries that poll. To be called and
   // destroyed on the queue itself. Null when the kernel refused or the queue has no descriptors (fakes).
-  virtual std::unique_ptr<DescriptorSource> watchDescriptor(int fd, std::uint32_t events,
+  // Throws std::bad_alloc.
+  virtual std::unique_ptr<DescriptorSource> watchDescriptor(int fd, Interest interest,
                                                             RunLoop::DescriptorHandler handler) = 0;
 };
 
@@ -63,6 +68,7 @@ class WorkQueue {
 class ProcessExitSource {
  public:
   virtual ~ProcessExitSource() = default;  // cancels without calling the cancel handler
+  // Begins to watch. Throws std::bad_alloc, and then watches nothing.
   virtual void activate() = 0;
   // Ends the watching. The cancel handler runs once, afterwards, on the queue.
   virtual void cancel() noexcept = 0;
@@ -90,11 +96,12 @@ class WorkQueues {
   // thread with another: throws OutOfQueues, as the posting of the first task may.
   virtual std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) = 0;
 
-  // Watches the process `pid` whose start time (field 22 of /proc/PID/stat, low 32 bits) is `startTime`. The
-  // event handler runs on global(), once the main run loop runs; so it does when that process is gone
-  // already, when the id names another one, and when the system lacks what it takes to watch it. Null when
-  // the kernel gives no descriptor for it.
-  virtual std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t startTime,
+  // Watches the process `pid` of that version: ids are used again, and the version tells one process from the
+  // others that had its id (processStartTime() in platform/base/ProcessFacts.h). The event handler runs on
+  // global(), once the main run loop runs. It also runs when that process is gone already, when the id names
+  // another process, and when the system lacks what it takes to watch it. Null when the kernel gives no
+  // descriptor for it. Throws std::bad_alloc.
+  virtual std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t version,
                                                                    WorkQueue::Task onExit,
                                                                    WorkQueue::Task onCancel) = 0;
 };

@@ -563,7 +563,7 @@ def queueing(asked, maps, to):
     return (re.search(r"(\A| < )brenvik::(LocationRoutines::dispatch\w+\([a-z, ]*\)|"
                       r"GeoRequests::dispatch\(std::function<void \(\)>\)::{lambda\(\)#1}::operator\(\)\(\)) ", whole)
             # Before that; what is asked for there fails as well.
-            or to == EVER and "brenvik::LocationRoutines::server_BVMobileHelperRequest" in whole)
+            or to == EVER and "brenvik::LocationRoutines::request" in whole)
 
 
 class Location(AllocationsTest):

@@ -80,7 +80,7 @@ struct Server {
                                 .sources = sources,
                                 .loop = *loop,
                                 .hasEntitlement = [this](const char*, const AuditToken&) { return admits; }};
-  ServerContext* context = nullptr;
+  std::unique_ptr<ServerContext> context;
   UniqueFd sealed{::memfd_create("fuzz", MFD_CLOEXEC | MFD_ALLOW_SEALING)};
   UniqueFd null{::open("/dev/null", O_RDONLY | O_CLOEXEC)};
 
@@ -160,6 +160,6 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   server.pump();
   server.ports.closing().drain();
   server.pump();
-  require(server.ports.size() == portsBefore && server.context->clientWatches.empty());
+  require(server.ports.size() == portsBefore && server.context->facts().clients == 0);
   return 0;
 }

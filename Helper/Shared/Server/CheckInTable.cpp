@@ -28,9 +28,8 @@ Outcome checkIn(void* context, const Request& request, Reply& reply) {
   AuditToken caller;
   std::memcpy(caller.words.data(), request.trailer().auditToken, sizeof caller.words);
   PortName clientPort = kNullPort;
-  const KernelReturn code =
-      BVMobileHelperCheckIn(platform.registry, platform, request.localPort(),
-                            request.as<CheckInRequest>().clientPort.name, &clientPort, caller);
+  const KernelReturn code = BVMobileHelperCheckIn(
+      platform, request.localPort(), request.as<CheckInRequest>().clientPort.name, &clientPort, caller);
   if (code != kern::success) {
     reply.setStatus(code);
     return Outcome::refused;

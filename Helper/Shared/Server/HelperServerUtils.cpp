@@ -2,10 +2,11 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "Helper/Shared/Server/HelperServerUtils.h"
 
+#include <algorithm>
 #include <bit>
 #include <chrono>
-#include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <limits>
 #include <new>
 #include <utility>
@@ -19,77 +20,6 @@ namespace {
 
 constexpr std::chrono::duration<double> kNoTimeOut{std::numeric_limits<double>::max()};
 
-using Lock = std::unique_lock<std::mutex>;
-
-void idleTimerTick(ServerContext& server) {
-  {
-    const Lock lock(server.lock);
-    // Cancelled by another thread while this tick was on its way.
-    if (server.idleTimer == nullptr) return;
-  }
-  if (!server.idleCheck || !server.idleCheck()) {
-    StopServer(server);
-    return;
-  }
-  const Lock lock(server.lock);
-  server.isKeptByIdleCheck = true;
-}
-
-// No lock held.
-void tellOfChange(const ServerContext& server) {
-  if (server.platform.onChange) server.platform.onChange();
-}
-
-// Lock held; given up for a moment when the timer cannot be made.
-void armIdleTimer(ServerContext& server, Lock& lock) {
-  if (server.idleTimer != nullptr) return;
-  server.idleSince = server.platform.now();
-  server.isKeptByIdleCheck = false;
-  RunLoop& loop = server.runLoop != nullptr ? *server.runLoop : server.platform.loop;
-  const std::chrono::nanoseconds period = server.platform.idlePeriod;
-  try {
-    server.idleTimer = loop.addTimer(
-        period, period, [&server] { idleTimerTick(server); }, [&server] { StopServer(server); });
-  } catch (const std::bad_alloc&) {
-    // No timer, as below.
-  }
-  if (server.idleTimer != nullptr) return;
-  lock.unlock();
-  StopServer(server);
-  lock.lock();
-}
-
-// Lock held.
-void cancelIdleTimer(ServerContext& server) {
-  if (server.idleTimer == nullptr) return;
-  server.idleTimer->invalidate();
-  server.idleTimer.reset();
-}
-
-// Lock held.
-void TearDownClient(ServerContext& server, const std::shared_ptr<DeathWatch>& deathWatch,
-                    PortName clientPort) {
-  const ServerPlatform& platform = server.platform;
-  if (deathWatch != nullptr) {
-    deathWatch->setInvalidationCallback({});
-    const PortName watched = deathWatch->port();
-    deathWatch->invalidate();
-    platform.registry.remove(watched);
-    (void)platform.ports.deallocateSendRight(watched);  // gone already when the check-in was refused late
-  }
-  server.clientWatches.erase(deathWatch.get());
-  if (const auto source = server.clientSources.find(clientPort); source != server.clientSources.end()) {
-    source->second->invalidate();
-    server.clientSources.erase(source);
-  }
-  if (isUsablePort(clientPort)) {
-    platform.registry.remove(clientPort);
-    LogCallers::shared().remove(clientPort);
-    (void)platform.ports.dropReceiveRight(clientPort);
-    (void)platform.ports.deallocateSendRight(clientPort);
-  }
-}
-
 [[noreturn]] void assertionFailed(const char* expression, const char* function, const char* source,
                                   int line) {
   logUnified(LogLevel::error, "Assertion failed: (%s), function %s, file %s, line %d.", expression, function,
@@ -99,101 +29,320 @@ void TearDownClient(ServerContext& server, const std::shared_ptr<DeathWatch>& de
 
 }  // namespace
 
-ServerContext* CreateServer(const ServerPlatform& platform, const char* serviceName,
-                            const RoutineTable& clientSubsystem) {
-  ServerContext* server = nullptr;
+// ---- a client ----
+
+// What was made for one client, as far as the making has come. Destroying it takes all of that back.
+class ServerContext::Client {
+ public:
+  explicit Client(const ServerPlatform& platform) noexcept : platform_(platform) {}
+  Client(const Client&) = delete;
+  Client& operator=(const Client&) = delete;
+  ~Client();
+
+  // Steps of the making, in this order. Each returns kern::success or the code of the check-in.
+  KernelReturn makePort() noexcept;
+  KernelReturn makeSource(const RoutineTable& table) noexcept;
+  KernelReturn watch(PortName callerPort) noexcept;
+  // Makes both ports known. Throws std::bad_alloc.
+  void enlist(ServerContext& server, const AuditToken& caller) const;
+  // The check-in succeeds: the server owns the right that is watched.
+  void adoptCallersRight() noexcept { watched_ = SendRight(platform_.ports, deathWatch_->port()); }
+
+  PortName port() const noexcept { return receive_.name(); }
+  DeathWatch& deathWatch() const noexcept { return *deathWatch_; }
+  RoutineSource& source() const noexcept { return *source_; }
+
+ private:
+  const ServerPlatform& platform_;
+  ReceiveRight receive_;
+  SendRight send_;
+  std::shared_ptr<RoutineSource> source_;
+  std::shared_ptr<DeathWatch> deathWatch_;
+  SendRight watched_;
+};
+
+KernelReturn ServerContext::Client::makePort() noexcept {
+  PortName port = kNullPort;
+  if (const KernelReturn code = platform_.ports.allocateReceiveRight(&port); code != kern::success) {
+    return code;
+  }
+  receive_ = ReceiveRight(platform_.ports, port);
+  if (const KernelReturn code = platform_.ports.insertSendRight(port); code != kern::success) return code;
+  send_ = SendRight(platform_.ports, port);
+  return kern::success;
+}
+
+KernelReturn ServerContext::Client::makeSource(const RoutineTable& table) noexcept {
+  source_ = platform_.sources.makeRoutineSource(port(), table, WantTrailer::no);
+  return source_ != nullptr ? kern::success : kern::failure;
+}
+
+KernelReturn ServerContext::Client::watch(PortName callerPort) noexcept {
+  deathWatch_ = platform_.sources.makeDeathWatch(callerPort, platform_.loop);
+  return deathWatch_ != nullptr ? kern::success : kern::failure;
+}
+
+void ServerContext::Client::enlist(ServerContext& server, const AuditToken& caller) const {
+  platform_.registry.add(port(), &server);
+  platform_.registry.add(deathWatch_->port(), &server);
+  if (platform_.describeCaller) LogCallers::shared().add(port(), platform_.describeCaller(caller));
+}
+
+ServerContext::Client::~Client() {
+  if (deathWatch_ != nullptr) {
+    deathWatch_->setInvalidationCallback({});
+    deathWatch_->invalidate();
+    platform_.registry.remove(deathWatch_->port());
+    watched_.reset();
+  }
+  if (source_ != nullptr) source_->invalidate();
+  if (receive_) {
+    platform_.registry.remove(port());
+    LogCallers::shared().remove(port());
+    receive_.reset();
+    send_.reset();
+  }
+}
+
+// ---- creation and destruction ----
+
+ServerContext::ServerContext(const ServerPlatform& platform, const RoutineTable& clientSubsystem)
+    : platform_(platform), clientSubsystem_(clientSubsystem) {}
+
+std::unique_ptr<ServerContext> ServerContext::make(const ServerPlatform& platform, const char* serviceName,
+                                                   const RoutineTable& clientSubsystem) {
+  std::unique_ptr<ServerContext> server;
   try {
-    server = new ServerContext(platform, clientSubsystem);
+    server.reset(new ServerContext(platform, clientSubsystem));
   } catch (const std::bad_alloc&) {
     return nullptr;
   }
-
-  PortName port = kNullPort;
   try {
-    if (platform.bootstrap.checkIn(serviceName, &port) == kern::success) {
-      server->servicePort = port;
-      platform.registry.add(port, server);
-      server->checkInSubsystem = makeCheckInTable(platform);
-      server->serviceSource =
-          platform.sources.makeRoutineSource(port, *server->checkInSubsystem, WantTrailer::yes);
-      if (server->serviceSource != nullptr && server->serviceSource->addTo(platform.loop)) return server;
-    }
+    if (server->serve(serviceName)) return server;
   } catch (const std::bad_alloc&) {
     // Out of resources, as the line says.
   }
-  // After a successful check-in DestroyServer drops the same right again, to no effect.
-  if (isUsablePort(port)) (void)platform.ports.dropReceiveRight(port);
+  // The destruction drops the same right again, to no effect.
+  if (server->servicePort_) (void)platform.ports.dropReceiveRight(server->servicePort());
   logUnified(LogLevel::error, "unable to create server objects - out of resources");
-  DestroyServer(server);
   return nullptr;
 }
 
-void SetIdleCheck(ServerContext* server, std::function<bool()> idleCheck) {
-  if (server == nullptr || !idleCheck) return;
-  server->idleCheck = std::move(idleCheck);
+bool ServerContext::serve(const char* serviceName) {
+  PortName port = kNullPort;
+  if (platform_.bootstrap.checkIn(serviceName, &port) != kern::success) return false;
+  servicePort_ = ReceiveRight(platform_.ports, port);
+  platform_.registry.add(port, this);
+  checkInSubsystem_ = makeCheckInTable(platform_);
+  serviceSource_ = platform_.sources.makeRoutineSource(port, *checkInSubsystem_, WantTrailer::yes);
+  return serviceSource_ != nullptr && serviceSource_->addTo(platform_.loop);
 }
 
-std::int32_t RunServer(ServerContext& server) {
-  server.runLoop = &server.platform.loop;
-  if (server.stopFlag) return 0;
+ServerContext::~ServerContext() {
+  idleCheck_ = nullptr;
+  if (serviceSource_ != nullptr) {
+    serviceSource_->invalidate();
+    serviceSource_.reset();
+  }
+  if (servicePort_) {
+    platform_.registry.remove(servicePort());
+    servicePort_.reset();
+  }
+  const Locked lock(*this);
+  while (!clients_.empty()) TearDownClient(lock, clients_.begin()->second->deathWatch());
+  cancelIdleTimer(lock);
+}
+
+// ---- run and stop ----
+
+std::int32_t ServerContext::run() {
+  runLoop_ = &platform_.loop;
+  if (isStopped_) return 0;
   RunResult result{};
   do {
-    result = server.runLoop->run(kNoTimeOut, ReturnAfterSource::yes);
-  } while (!server.stopFlag);
+    result = runLoop_->run(kNoTimeOut, ReturnAfterSource::yes);
+  } while (!isStopped_);
   return static_cast<std::int32_t>(result);
 }
 
+void ServerContext::stop() noexcept {
+  isStopped_ = true;
+  if (runLoop_ != nullptr) runLoop_->stop();
+}
+
+// ---- the idle rule ----
+
+void ServerContext::idleTimerTick() {
+  {
+    const Locked lock(*this);
+    // Cancelled by another thread while this tick was on its way.
+    if (idleTimer_ == nullptr) return;
+  }
+  if (!idleCheck_ || !idleCheck_()) {
+    stop();
+    return;
+  }
+  const Locked lock(*this);
+  isKeptByIdleCheck_ = true;
+}
+
+void ServerContext::armIdleTimerIfIdle(Locked& lock) {
+  if (busyMask_ != 0 || !clients_.empty() || idleTimer_ != nullptr) return;
+  idleSince_ = platform_.now();
+  isKeptByIdleCheck_ = false;
+  const std::chrono::nanoseconds period = platform_.idlePeriod;
+  try {
+    idleTimer_ = platform_.loop.addTimer(
+        period, period, [this] { idleTimerTick(); }, [this] { stop(); });
+  } catch (const std::bad_alloc&) {
+    // No timer, as below.
+  }
+  if (idleTimer_ != nullptr) return;
+  lock.unlock();
+  stop();
+  lock.lock();
+}
+
+void ServerContext::cancelIdleTimer(const Locked&) noexcept {
+  if (idleTimer_ == nullptr) return;
+  idleTimer_->invalidate();
+  idleTimer_.reset();
+}
+
+void ServerContext::tellOfChange() const {
+  if (platform_.onChange) platform_.onChange();
+}
+
+// ---- busy tokens ----
+
+std::uint32_t ServerContext::acquireBusyToken(const char* reason) {
+  Locked lock(*this);
+  // The run of set bits from bit 0 is what counts: a hole above a clear bit 0 is not looked for. With all 32
+  // set the shift wraps, and bit 0 is given once more.
+  const auto run = static_cast<unsigned>(std::countr_one(busyMask_));
+  const std::uint32_t token = std::uint32_t{1} << (run % 32U);
+  busyMask_ |= token;
+  busyReasons_[run % 32U] = reason;
+  cancelIdleTimer(lock);
+  lock.unlock();
+  tellOfChange();
+  return token;
+}
+
+void ServerContext::releaseBusyToken(std::uint32_t token) {
+  Locked lock(*this);
+  busyMask_ &= ~token;
+  armIdleTimerIfIdle(lock);
+  lock.unlock();
+  tellOfChange();
+}
+
+std::uint32_t ServerContext::busyMask() const noexcept {
+  const Locked lock(*this);
+  return busyMask_;
+}
+
+bool ServerContext::isCountingDown() const noexcept {
+  const Locked lock(*this);
+  return idleTimer_ != nullptr;
+}
+
+ServerFacts ServerContext::facts() const {
+  ServerFacts facts;
+  const Locked lock(*this);
+  facts.clients = clients_.size();
+  for (std::size_t bit = 0; bit < busyReasons_.size(); ++bit) {
+    if ((busyMask_ >> bit & 1U) == 0) continue;
+    const char* const reason = busyReasons_[bit];
+    const auto known =
+        std::find_if(facts.busyTokens.begin(), facts.busyTokens.end(),
+                     [reason](const auto& each) { return std::strcmp(each.first, reason) == 0; });
+    if (known != facts.busyTokens.end()) {
+      ++known->second;
+    } else {
+      facts.busyTokens.emplace_back(reason, 1);
+    }
+  }
+  if (idleTimer_ == nullptr) return facts;
+  const auto period = platform_.idlePeriod;
+  facts.leavesIn = period - (platform_.now() - idleSince_) % period;
+  facts.isKeptByIdleCheck = isKeptByIdleCheck_;
+  return facts;
+}
+
+// ---- clients ----
+
+KernelReturn ServerContext::admit(PortName callerPort, PortName* clientPort, const AuditToken& caller) {
+  auto made = std::make_unique<Client>(platform_);
+  Client& client = *made;
+  if (const KernelReturn code = client.makePort(); code != kern::success) return code;
+  if (const KernelReturn code = client.makeSource(clientSubsystem_); code != kern::success) return code;
+  if (const KernelReturn code = client.watch(callerPort); code != kern::success) return code;
+  client.enlist(*this, caller);
+  DeathWatch& deathWatch = client.deathWatch();
+  {
+    const Locked lock(*this);
+    clients_.emplace(&deathWatch, std::move(made));
+  }
+  const bool isServed = client.source().addTo(platform_.loop);
+  deathWatch.setInvalidationCallback(
+      [this](DeathWatch& dead) { OnClientPortDied(dead, this, platform_.registry); });
+
+  Locked lock(*this);
+  if (!isServed) {
+    // The loop cannot watch the new port: a client that nobody would serve is not let in.
+    TearDownClient(lock, deathWatch);
+    return kern::failure;
+  }
+  cancelIdleTimer(lock);
+  lock.unlock();
+  tellOfChange();
+  // The callback, which is on its way, tears the client down.
+  if (!deathWatch.isValid()) return kern::failure;
+  client.adoptCallersRight();
+  *clientPort = client.port();
+  return kern::success;
+}
+
+void ServerContext::TearDownClient(const Locked&, DeathWatch& deathWatch) noexcept {
+  (void)clients_.extract(&deathWatch);
+}
+
+void ServerContext::clientPortDied(DeathWatch& deathWatch) {
+  Locked lock(*this);
+  TearDownClient(lock, deathWatch);
+  armIdleTimerIfIdle(lock);
+  lock.unlock();
+  tellOfChange();
+}
+
+// ---- the functions ----
+
+std::unique_ptr<ServerContext> CreateServer(const ServerPlatform& platform, const char* serviceName,
+                                            const RoutineTable& clientSubsystem) {
+  return ServerContext::make(platform, serviceName, clientSubsystem);
+}
+
+void SetIdleCheck(ServerContext* server, std::function<bool()> idleCheck) {
+  if (server != nullptr && idleCheck) server->setIdleCheck(std::move(idleCheck));
+}
+
+std::int32_t RunServer(ServerContext& server) { return server.run(); }
+
 std::int32_t StopServer(ServerContext& server) {
-  server.stopFlag = true;
-  if (server.runLoop != nullptr) server.runLoop->stop();
+  server.stop();
   return 0;
 }
 
-void DestroyServer(ServerContext* server) {
-  if (server == nullptr) return;
-  const ServerPlatform& platform = server->platform;
-  server->idleCheck = nullptr;
-  if (server->serviceSource != nullptr) {
-    server->serviceSource->invalidate();
-    server->serviceSource.reset();
-  }
-  if (isUsablePort(server->servicePort)) {
-    platform.registry.remove(server->servicePort);
-    (void)platform.ports.dropReceiveRight(server->servicePort);
-  }
-  {
-    const Lock lock(server->lock);
-    while (!server->clientWatches.empty()) {
-      const ServerContext::Client client = server->clientWatches.begin()->second;
-      TearDownClient(*server, client.deathWatch, client.receivePort);
-    }
-    server->clientSources.clear();
-    cancelIdleTimer(*server);
-  }
-  delete server;
-}
+void DestroyServer(std::unique_ptr<ServerContext> server) { server.reset(); }
 
 std::uint32_t AcquireBusyToken(ServerContext& server, const char* reason) {
-  Lock lock(server.lock);
-  // The run of set bits from bit 0 is what counts: a hole above a clear bit 0 is not looked for. With all 32
-  // set the shift wraps, and bit 0 is given once more.
-  const auto run = static_cast<unsigned>(std::countr_one(server.busyMask));
-  const std::uint32_t token = std::uint32_t{1} << (run % 32U);
-  server.busyMask |= token;
-  server.busyReasons[run % 32U] = reason;
-  cancelIdleTimer(server);
-  lock.unlock();
-  tellOfChange(server);
-  return token;
+  return server.acquireBusyToken(reason);
 }
 
 std::uint32_t ReleaseBusyToken(ServerContext& server, std::uint32_t token) {
   if (!std::has_single_bit(token)) return 0;
-  Lock lock(server.lock);
-  server.busyMask &= ~token;
-  if (server.busyMask == 0 && server.clientWatches.empty()) armIdleTimer(server, lock);
-  lock.unlock();
-  tellOfChange(server);
+  server.releaseBusyToken(token);
   return 1;
 }
 
@@ -201,82 +350,19 @@ ServerContext* LookupServer(PortServerRegistry& registry, PortName port) noexcep
   return registry.lookUp(port);
 }
 
-KernelReturn BVMobileHelperCheckIn(PortServerRegistry& registry, const ServerPlatform& platform,
-                                   PortName servicePort, PortName callerPort, PortName* clientPort,
-                                   const AuditToken& caller) {
+KernelReturn BVMobileHelperCheckIn(const ServerPlatform& platform, PortName servicePort, PortName callerPort,
+                                   PortName* clientPort, const AuditToken& caller) {
   *clientPort = kNullPort;
   const LogScope scope(kCheckInRoutine.name, servicePort);
   if (!platform.hasEntitlement(kAllowEntitlement, caller)) return kern::invalidSecurity;
-  ServerContext* const server = LookupServer(registry, servicePort);
-  if (server == nullptr) return kern::failure;
-
-  PortName port = kNullPort;
-  KernelReturn code = platform.ports.allocateReceiveRight(&port);
-  if (code != kern::success) return code;
-  code = platform.ports.insertSendRight(port);
-  if (code != kern::success) {
-    (void)platform.ports.dropReceiveRight(port);
-    return code;
-  }
-
-  const auto giveUp = [&](KernelReturn status) {
-    (void)platform.ports.dropReceiveRight(port);
-    (void)platform.ports.deallocateSendRight(port);
-    return status;
-  };
-  auto source = platform.sources.makeRoutineSource(port, server->clientSubsystem, WantTrailer::no);
-  if (source == nullptr) return giveUp(kern::failure);
-  auto deathWatch = platform.sources.makeDeathWatch(callerPort, platform.loop, server);
-  if (deathWatch == nullptr) {
-    source->invalidate();
-    return giveUp(kern::failure);
-  }
-
-  try {
-    registry.add(port, server);
-    registry.add(deathWatch->port(), server);
-    if (platform.describeCaller) LogCallers::shared().add(port, platform.describeCaller(caller));
-    const Lock lock(server->lock);
-    server->clientWatches.emplace(deathWatch.get(), ServerContext::Client{deathWatch, port});
-    server->clientSources.emplace(port, source);
-  } catch (const std::bad_alloc&) {
-    source->invalidate();
-    const Lock lock(server->lock);
-    TearDownClient(*server, deathWatch, port);
-    return kern::resourceShortage;
-  }
-  const bool added = source->addTo(platform.loop);
-  deathWatch->setInvalidationCallback([&registry](DeathWatch& dead) {
-    OnClientPortDied(dead, static_cast<ServerContext*>(dead.info()), registry);
-  });
-
-  Lock lock(server->lock);
-  if (!added) {
-    // The loop cannot watch the new port: a client that nobody would serve is not let in.
-    TearDownClient(*server, deathWatch, port);
-    return kern::failure;
-  }
-  cancelIdleTimer(*server);
-  lock.unlock();
-  tellOfChange(*server);
-  if (!deathWatch->isValid())
-    return kern::failure;  // the callback, already on its way, tears the client down
-  *clientPort = port;
-  return kern::success;
+  ServerContext* const server = LookupServer(platform.registry, servicePort);
+  return server != nullptr ? server->admit(callerPort, clientPort, caller) : kern::failure;
 }
 
 void OnClientPortDied(DeathWatch& deathWatch, ServerContext* context, PortServerRegistry& registry) {
   ServerContext* const server = context != nullptr ? context : LookupServer(registry, deathWatch.port());
   if (server == nullptr) assertionFailed("server", "MachPortInvalidationCallBack", "HelperServerUtils", 317);
-  Lock lock(server->lock);
-  const auto client = server->clientWatches.find(&deathWatch);
-  if (client != server->clientWatches.end()) {
-    const ServerContext::Client dead = client->second;
-    TearDownClient(*server, dead.deathWatch, dead.receivePort);
-  }
-  if (server->busyMask == 0 && server->clientWatches.empty()) armIdleTimer(*server, lock);
-  lock.unlock();
-  tellOfChange(*server);
+  server->clientPortDied(deathWatch);
 }
 
 }  // namespace brenvik

@@ -21,8 +21,6 @@ using namespace std::chrono_literals;
 
 class ServerTest : public testing::Test {
  protected:
-  ~ServerTest() override { DestroyServer(server); }
-
   void create() {
     server = CreateServer(platform, kServiceName, routines);
     ASSERT_NE(server, nullptr);
@@ -30,8 +28,7 @@ class ServerTest : public testing::Test {
 
   KernelReturn checkIn() {
     callerPort = ports.adoptSendRight();
-    return BVMobileHelperCheckIn(registry, platform, server->servicePort, callerPort, &clientPort,
-                                 AuditToken{});
+    return BVMobileHelperCheckIn(platform, server->servicePort(), callerPort, &clientPort, AuditToken{});
   }
   // The client whose check-in was the n-th dies.
   void clientDies(std::size_t n) { sources.deathWatches.at(n)->tellDeath(); }
@@ -55,7 +52,7 @@ class ServerTest : public testing::Test {
                           },
                           registry};
   NoRoutines routines;
-  ServerContext* server = nullptr;
+  std::unique_ptr<ServerContext> server;
   PortName callerPort = kNullPort;
   PortName clientPort = kNullPort;
   RecordingLog log;
@@ -66,10 +63,10 @@ class ServerTest : public testing::Test {
 TEST_F(ServerTest, CreationChecksTheServiceNameInAndServesCheckInsOnItsPort) {
   create();
   EXPECT_EQ(bootstrap.name, "com.norvale.brenvik.mobile-helper");
-  EXPECT_EQ(registry.lookUp(server->servicePort), server);
+  EXPECT_EQ(registry.lookUp(server->servicePort()), server.get());
   ASSERT_EQ(sources.routineSources.size(), 1U);
   const auto& source = *sources.routineSources[0];
-  EXPECT_EQ(source.port, server->servicePort);
+  EXPECT_EQ(source.port, server->servicePort());
   EXPECT_TRUE(source.added);
   EXPECT_EQ(source.wantTrailer, WantTrailer::yes);
   EXPECT_NE(source.table.find(4792174), nullptr);
@@ -133,7 +130,7 @@ TEST_F(ServerTest, DestructionTearsEveryClientDownAndGivesThePortBack) {
   create();
   ASSERT_EQ(checkIn(), kern::success);
   ASSERT_EQ(checkIn(), kern::success);
-  DestroyServer(std::exchange(server, nullptr));
+  DestroyServer(std::move(server));
   EXPECT_EQ(registry.size(), 0U);
   EXPECT_TRUE(ports.receiveRights.empty());
   EXPECT_TRUE(ports.sendRights.empty());
@@ -167,7 +164,7 @@ TEST_F(ServerTest, NoClientEverConnectsAndTheProcessKeepsRunningWithoutATimer) {
   create();
   clock.advance(std::chrono::hours(24 * 365));
   EXPECT_EQ(loop.stops, 0);
-  EXPECT_FALSE(server->stopFlag);
+  EXPECT_FALSE(server->isStopped());
   EXPECT_FALSE(idleTimerRuns());
 }
 
@@ -175,7 +172,7 @@ TEST_F(ServerTest, LastClientGoesAwayWhileTheHostedServerIsBusyAndTheProcessStay
   create();
   int asked = 0;
   bool busy = true;
-  SetIdleCheck(server, [&] {
+  SetIdleCheck(server.get(), [&] {
     ++asked;
     return busy;
   });
@@ -187,11 +184,11 @@ TEST_F(ServerTest, LastClientGoesAwayWhileTheHostedServerIsBusyAndTheProcessStay
   EXPECT_EQ(asked, 1);
   clock.advance(20s);
   EXPECT_EQ(asked, 3);
-  EXPECT_FALSE(server->stopFlag);
+  EXPECT_FALSE(server->isStopped());
   busy = false;
   clock.advance(10s);
   EXPECT_EQ(asked, 4);
-  EXPECT_TRUE(server->stopFlag);
+  EXPECT_TRUE(server->isStopped());
 }
 
 TEST_F(ServerTest, WithoutAHostedServerTheProcessStopsAtTheFirstTick10SecondsAfterTheLastClient) {
@@ -200,9 +197,9 @@ TEST_F(ServerTest, WithoutAHostedServerTheProcessStopsAtTheFirstTick10SecondsAft
   clock.advance(60s);
   clientDies(0);
   clock.advance(9999ms);
-  EXPECT_FALSE(server->stopFlag);
+  EXPECT_FALSE(server->isStopped());
   clock.advance(1ms);
-  EXPECT_TRUE(server->stopFlag);
+  EXPECT_TRUE(server->isStopped());
 }
 
 TEST_F(ServerTest, WithoutAHostedServerTheProcessStopsAtTheFirstTick10SecondsAfterTheLastToken) {
@@ -211,9 +208,9 @@ TEST_F(ServerTest, WithoutAHostedServerTheProcessStopsAtTheFirstTick10SecondsAft
   clock.advance(60s);
   EXPECT_EQ(ReleaseBusyToken(*server, token), 1U);
   clock.advance(9999ms);
-  EXPECT_FALSE(server->stopFlag);
+  EXPECT_FALSE(server->isStopped());
   clock.advance(1ms);
-  EXPECT_TRUE(server->stopFlag);
+  EXPECT_TRUE(server->isStopped());
 }
 
 TEST_F(ServerTest, ACheckInDuringTheIdlePeriodCancelsTheTimerAndTheCountdownRestartsFrom10Seconds) {
@@ -226,9 +223,9 @@ TEST_F(ServerTest, ACheckInDuringTheIdlePeriodCancelsTheTimerAndTheCountdownRest
   clock.advance(60s);
   clientDies(1);
   clock.advance(9999ms);
-  EXPECT_FALSE(server->stopFlag);
+  EXPECT_FALSE(server->isStopped());
   clock.advance(1ms);
-  EXPECT_TRUE(server->stopFlag);
+  EXPECT_TRUE(server->isStopped());
 }
 
 TEST_F(ServerTest, ANewBusyTokenDuringTheIdlePeriodCancelsTheTimerAndTheCountdownRestartsFrom10Seconds) {
@@ -241,9 +238,9 @@ TEST_F(ServerTest, ANewBusyTokenDuringTheIdlePeriodCancelsTheTimerAndTheCountdow
   clock.advance(60s);
   ReleaseBusyToken(*server, token);
   clock.advance(9999ms);
-  EXPECT_FALSE(server->stopFlag);
+  EXPECT_FALSE(server->isStopped());
   clock.advance(1ms);
-  EXPECT_TRUE(server->stopFlag);
+  EXPECT_TRUE(server->isStopped());
 }
 
 TEST_F(ServerTest, AnIdleTimerThatCannotBeMadeStopsTheServerAtOnce) {
@@ -251,7 +248,7 @@ TEST_F(ServerTest, AnIdleTimerThatCannotBeMadeStopsTheServerAtOnce) {
   ASSERT_EQ(checkIn(), kern::success);
   loop.refuseTimers = true;
   clientDies(0);
-  EXPECT_TRUE(server->stopFlag);
+  EXPECT_TRUE(server->isStopped());
 }
 
 TEST_F(ServerTest, AnIdleTimerThatCannotBeArmedInTheEndStopsTheServerToo) {
@@ -259,9 +256,9 @@ TEST_F(ServerTest, AnIdleTimerThatCannotBeArmedInTheEndStopsTheServerToo) {
   const auto token = AcquireBusyToken(*server);
   loop.failTimersLater = true;
   ReleaseBusyToken(*server, token);
-  EXPECT_FALSE(server->stopFlag);
+  EXPECT_FALSE(server->isStopped());
   clock.advance(0ms);
-  EXPECT_TRUE(server->stopFlag);
+  EXPECT_TRUE(server->isStopped());
 }
 
 TEST_F(ServerTest, ATickThatWasOnItsWayWhenATokenWasTakenStopsNothing) {
@@ -270,7 +267,7 @@ TEST_F(ServerTest, ATickThatWasOnItsWayWhenATokenWasTakenStopsNothing) {
   const auto tick = loop.lastTimersHandler;
   AcquireBusyToken(*server);
   tick();
-  EXPECT_FALSE(server->stopFlag);
+  EXPECT_FALSE(server->isStopped());
 }
 
 TEST_F(ServerTest, ArmingTwiceKeepsTheFirstCountdown) {
@@ -281,18 +278,18 @@ TEST_F(ServerTest, ArmingTwiceKeepsTheFirstCountdown) {
   ReleaseBusyToken(*server, 0x4);  // well formed, though nobody holds it
   EXPECT_TRUE(idleTimerRuns());
   clock.advance(5s);
-  EXPECT_TRUE(server->stopFlag);
+  EXPECT_TRUE(server->isStopped());
 }
 
 TEST_F(ServerTest, SetIdleCheckWithoutServerOrBlockDoesNothing) {
   create();
   SetIdleCheck(nullptr, [] { return true; });
-  SetIdleCheck(server, [] { return true; });
-  SetIdleCheck(server, {});
+  SetIdleCheck(server.get(), [] { return true; });
+  SetIdleCheck(server.get(), {});
   const auto token = AcquireBusyToken(*server);
   ReleaseBusyToken(*server, token);
   clock.advance(60s);
-  EXPECT_FALSE(server->stopFlag) << "the check that answers true is still in place";
+  EXPECT_FALSE(server->isStopped()) << "the check that answers true is still in place";
 }
 
 // ---- busy tokens ----
@@ -303,7 +300,7 @@ TEST_F(ServerTest, ReleaseBusyTokenWith0OrWith0x3Returns0AndLeavesTheMask) {
   AcquireBusyToken(*server);
   EXPECT_EQ(ReleaseBusyToken(*server, 0), 0U);
   EXPECT_EQ(ReleaseBusyToken(*server, 0x3), 0U);
-  EXPECT_EQ(server->busyMask, 0x3U);
+  EXPECT_EQ(server->busyMask(), 0x3U);
   EXPECT_FALSE(idleTimerRuns());
 }
 
@@ -315,14 +312,14 @@ TEST_F(ServerTest, TokensAreTakenAboveTheRunOfHeldBitsFromBit0) {
   ReleaseBusyToken(*server, 2);
   EXPECT_EQ(AcquireBusyToken(*server), 2U);
   ReleaseBusyToken(*server, 1);
-  EXPECT_EQ(server->busyMask, 0x6U);
+  EXPECT_EQ(server->busyMask(), 0x6U);
   EXPECT_EQ(AcquireBusyToken(*server), 1U) << "a clear bit 0 below held bits is taken";
 }
 
 TEST_F(ServerTest, WithAll32TokensHeldTheNextOneIs1Again) {
   create();
   for (int i = 0; i < 32; ++i) AcquireBusyToken(*server);
-  EXPECT_EQ(server->busyMask, 0xFFFFFFFFU);
+  EXPECT_EQ(server->busyMask(), 0xFFFFFFFFU);
   EXPECT_EQ(AcquireBusyToken(*server), 1U);
 }
 
@@ -350,14 +347,14 @@ TEST_F(ServerTest, AnEntitledCallerGetsAPortOfItsOwn) {
   EXPECT_TRUE(source.added);
   EXPECT_EQ(ports.receiveRights.at(clientPort), 1);
   EXPECT_EQ(ports.sendRights.at(clientPort), 1);
-  EXPECT_EQ(LookupServer(registry, clientPort), server);
-  EXPECT_EQ(LookupServer(registry, callerPort), server);
+  EXPECT_EQ(LookupServer(registry, clientPort), server.get());
+  EXPECT_EQ(LookupServer(registry, callerPort), server.get());
 }
 
 TEST_F(ServerTest, ThePortOfAClientIsKnownToTheLogForAsLongAsTheClientIsThere) {
-  create();
   const auto described = std::make_shared<const LogCaller>();
   platform.describeCaller = [&](const AuditToken&) { return described; };
+  create();
   ASSERT_EQ(checkIn(), kern::success);
   EXPECT_EQ(LogCallers::shared().find(clientPort), described);
   clientDies(0);
@@ -388,7 +385,7 @@ TEST_F(ServerTest, ACallerWithoutTheEntitlementGets35AndNoPortAndTheIdleStateIsU
   EXPECT_EQ(sources.routineSources.size(), 1U);
   EXPECT_EQ(registry.size(), 1U);
   clock.advance(5s);
-  EXPECT_TRUE(server->stopFlag) << "the countdown went on";
+  EXPECT_TRUE(server->isStopped()) << "the countdown went on";
 }
 
 TEST_F(ServerTest, TwoCheckInsGiveTwoIndependentPortsEachTornDownWhenItsWatchedPortDies) {
@@ -401,7 +398,7 @@ TEST_F(ServerTest, TwoCheckInsGiveTwoIndependentPortsEachTornDownWhenItsWatchedP
   clientDies(0);
   EXPECT_EQ(LookupServer(registry, first), nullptr);
   EXPECT_FALSE(sources.routineSources[1]->valid);
-  EXPECT_EQ(LookupServer(registry, second), server);
+  EXPECT_EQ(LookupServer(registry, second), server.get());
   EXPECT_TRUE(sources.routineSources[2]->valid);
   clientDies(1);
   EXPECT_EQ(registry.size(), 1U) << "only the service port is left";
@@ -465,7 +462,53 @@ TEST_F(ServerTest, ASourceOrDeathWatchThatCannotBeMadeGives5AndLeavesNoState) {
   EXPECT_EQ(clientPort, kNullPort);
   EXPECT_EQ(ports.receiveRights.size(), 1U);
   EXPECT_EQ(registry.size(), 1U);
-  EXPECT_TRUE(server->clientWatches.empty());
+  EXPECT_EQ(server->facts().clients, 0U);
+}
+
+TEST_F(ServerTest, TheServerOwnsTheCallersRightFromASuccessfulCheckInOn) {
+  create();
+  const auto expectRefusalWithoutTheRight = [&] {
+    EXPECT_EQ(checkIn(), kern::failure);
+    EXPECT_EQ(ports.sendRights, (std::map<PortName, int>{{callerPort, 1}})) << "it stays with the message";
+    ports.sendRights.clear();
+  };
+  sources.refuseDeathWatches = true;
+  expectRefusalWithoutTheRight();
+  sources.refuseDeathWatches = false;
+  sources.refuseToBeAdded = true;
+  expectRefusalWithoutTheRight();
+  sources.refuseToBeAdded = false;
+  ASSERT_EQ(checkIn(), kern::success);
+  clientDies(1);
+  EXPECT_TRUE(ports.sendRights.empty());
+  EXPECT_EQ(ports.failedDrops, 0);
+}
+
+TEST_F(ServerTest, ACheckInLeavesNothingWhereverMemoryRunsOut) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "nothing fails under this sanitizer";
+  create();
+  int failures = 0;
+  for (long number = 0;; ++number) {
+    callerPort = ports.adoptSendRight();
+    sources.routineSources.reserve(64);
+    sources.deathWatches.reserve(64);
+    bool isDone = true;
+    try {
+      const FailingAllocations failing(number, FailingAllocations::HowMany::one);
+      isDone = server->admit(callerPort, &clientPort, AuditToken{}) == kern::success;
+    } catch (const std::bad_alloc&) {
+      isDone = false;
+      ++failures;
+    }
+    if (isDone) break;
+    EXPECT_EQ(registry.size(), 1U) << number;
+    EXPECT_EQ(ports.receiveRights.size(), 1U) << number;
+    EXPECT_EQ(ports.sendRights, (std::map<PortName, int>{{callerPort, 1}})) << number;
+    EXPECT_EQ(server->facts().clients, 0U) << number;
+    ports.sendRights.clear();
+  }
+  EXPECT_GE(failures, 4) << "the client, two names in the registry, the entry";
+  EXPECT_EQ(server->facts().clients, 1U);
 }
 
 TEST_F(ServerTest, ACallerWhosePortIsAlreadyDeadGets5AndIsTornDownByTheCallback) {
@@ -473,25 +516,23 @@ TEST_F(ServerTest, ACallerWhosePortIsAlreadyDeadGets5AndIsTornDownByTheCallback)
   sources.portsAreDead = true;
   EXPECT_EQ(checkIn(), kern::failure);
   EXPECT_EQ(clientPort, kNullPort);
-  EXPECT_EQ(server->clientWatches.size(), 1U) << "the entries stay for the callback";
+  EXPECT_EQ(server->facts().clients, 1U) << "the entries stay for the callback";
   EXPECT_FALSE(idleTimerRuns());
   clientDies(0);
-  EXPECT_TRUE(server->clientWatches.empty());
-  EXPECT_TRUE(server->clientSources.empty());
+  EXPECT_EQ(server->facts().clients, 0U);
   EXPECT_TRUE(idleTimerRuns());
 }
 
-TEST_F(ServerTest, ADeathWatchWithoutInfoIsFoundByItsPortName) {
+TEST_F(ServerTest, ADeathWithoutAContextIsTheServersThatOwnsTheWatchedPort) {
   create();
-  sources.dropInfo = true;
   ASSERT_EQ(checkIn(), kern::success);
-  clientDies(0);
-  EXPECT_TRUE(server->clientWatches.empty());
+  OnClientPortDied(*sources.deathWatches[0], nullptr, registry);
+  EXPECT_EQ(server->facts().clients, 0U);
 }
 
 TEST_F(ServerTest, ADeathThatBelongsToNoServerStopsTheProcessOnAnAssertion) {
   create();
-  FakeDeathWatch stray(0x777, nullptr);
+  FakeDeathWatch stray(0x777);
   EXPECT_DEATH(
       {
         class StandardError final : public LogSink {
@@ -516,7 +557,7 @@ class CheckInHandlerTest : public ServerTest {
     message.header.bits = kComplexBit | kReplyDisposition;
     message.header.size = sizeof message;
     message.header.replyPort = 7;
-    message.header.localPort = server->servicePort;
+    message.header.localPort = server->servicePort();
     message.header.id = kCheckInRoutine.id;
     message.descriptorCount = 1;
     message.clientPort.name = ports.adoptSendRight();
@@ -555,7 +596,7 @@ TEST_F(CheckInHandlerTest, AGoodCheckInIsAnsweredWithTheClientsPortAsACopySendRi
   EXPECT_EQ(answer.descriptorCount, 1U);
   EXPECT_EQ(answer.servicePort.disposition, 19);
   EXPECT_EQ(answer.servicePort.type, 0);
-  EXPECT_EQ(LookupServer(registry, answer.servicePort.name), server);
+  EXPECT_EQ(LookupServer(registry, answer.servicePort.name), server.get());
 }
 
 TEST_F(CheckInHandlerTest, SizeComplexFlagOrCountThatIsWrongGetsMinus304) {

@@ -10,8 +10,6 @@
 
 namespace brenvik {
 
-class ServerContext;
-
 // What keeps a server, at this moment.
 struct ServerFacts {
   std::size_t clients = 0;
@@ -21,8 +19,5 @@ struct ServerFacts {
   std::optional<std::chrono::nanoseconds> leavesIn;
   bool isKeptByIdleCheck = false;  // as it answered at the last tick
 };
-
-// Any thread. Throws std::bad_alloc.
-ServerFacts describeServer(const ServerContext& server);
 
 }  // namespace brenvik

@@ -344,8 +344,7 @@ class ScarceQueues final : public WorkQueues {
       return nullptr;
     }
     bool isCurrent() const noexcept override { return real.isCurrent(); }
-    std::unique_ptr<DescriptorSource> watchDescriptor(int, std::uint32_t,
-                                                      RunLoop::DescriptorHandler) override {
+    std::unique_ptr<DescriptorSource> watchDescriptor(int, Interest, RunLoop::DescriptorHandler) override {
       return nullptr;
     }
 

@@ -5,6 +5,7 @@
 #include <deque>
 #include <map>
 #include <memory>
+#include <new>
 #include <string>
 #include <utility>
 #include <vector>
@@ -14,20 +15,24 @@
 namespace brenvik {
 
 // Ports without descriptors: names, references and refusals as a test asks for them. A right dropped once too
-// often is an error here as it is in the real space.
+// often is an error here as it is in the real space, and lack of memory is a shortage.
 class FakePortSpace final : public PortSpace {
  public:
-  KernelReturn allocateReceiveRight(PortName* name) noexcept override {
+  KernelReturn allocateReceiveRight(PortName* name) noexcept override try {
     if (refuseAllocate != kern::success) return refuseAllocate;
+    receiveRights[next_] = 1;
     *name = next_++;
-    receiveRights[*name] = 1;
     return kern::success;
+  } catch (const std::bad_alloc&) {
+    return kern::resourceShortage;
   }
-  KernelReturn insertSendRight(PortName name) noexcept override {
+  KernelReturn insertSendRight(PortName name) noexcept override try {
     if (refuseInsert != kern::success) return refuseInsert;
     if (receiveRights.count(name) == 0) return kern::invalidName;
     ++sendRights[name];
     return kern::success;
+  } catch (const std::bad_alloc&) {
+    return kern::resourceShortage;
   }
   KernelReturn dropReceiveRight(PortName name) noexcept override { return drop(receiveRights, name); }
   KernelReturn deallocateSendRight(PortName name) noexcept override { return drop(sendRights, name); }
@@ -90,14 +95,13 @@ class FakeRoutineSource final : public RoutineSource {
 
 class FakeDeathWatch final : public DeathWatch {
  public:
-  FakeDeathWatch(PortName port, void* info) : port_(port), info_(info) {}
+  explicit FakeDeathWatch(PortName port) : port_(port) {}
   PortName port() const noexcept override { return port_; }
   bool isValid() const noexcept override { return valid_ && !died; }
   void setInvalidationCallback(std::function<void(DeathWatch&)> callback) noexcept override {
     callback_ = std::move(callback);
   }
   void invalidate() noexcept override { valid_ = false; }
-  void* info() const noexcept override { return info_; }
 
   // The run loop notices that the port has died.
   void tellDeath() {
@@ -110,7 +114,6 @@ class FakeDeathWatch final : public DeathWatch {
 
  private:
   const PortName port_;
-  void* const info_;
   bool valid_ = true;
   std::function<void(DeathWatch&)> callback_;
 };
@@ -125,19 +128,23 @@ class NoRoutines final : public RoutineTable {
 class FakePortSources final : public PortSources {
  public:
   std::shared_ptr<RoutineSource> makeRoutineSource(PortName port, const RoutineTable& table,
-                                                   WantTrailer trailer) noexcept override {
+                                                   WantTrailer trailer) noexcept override try {
     if (refuseRoutineSources) return nullptr;
     auto source = std::make_shared<FakeRoutineSource>(port, table, trailer);
     source->refuseToBeAdded = refuseToBeAdded;
     routineSources.push_back(source);
     return source;
+  } catch (const std::bad_alloc&) {
+    return nullptr;
   }
-  std::shared_ptr<DeathWatch> makeDeathWatch(PortName port, RunLoop&, void* info) noexcept override {
+  std::shared_ptr<DeathWatch> makeDeathWatch(PortName port, RunLoop&) noexcept override try {
     if (refuseDeathWatches) return nullptr;
-    auto watch = std::make_shared<FakeDeathWatch>(port, dropInfo ? nullptr : info);
+    auto watch = std::make_shared<FakeDeathWatch>(port);
     watch->died = portsAreDead;
     deathWatches.push_back(watch);
     return watch;
+  } catch (const std::bad_alloc&) {
+    return nullptr;
   }
 
   std::vector<std::shared_ptr<FakeRoutineSource>> routineSources;
@@ -146,7 +153,6 @@ class FakePortSources final : public PortSources {
   bool refuseToBeAdded = false;
   bool refuseDeathWatches = false;
   bool portsAreDead = false;
-  bool dropInfo = false;
 };
 
 }  // namespace brenvik

@@ -2,7 +2,6 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/ipc/linux/StatusSocket.h"
 
-#include <sys/epoll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -76,7 +75,7 @@ bool StatusSocket::listen(const std::string& servicePath) {
     if (::lchown(path_.c_str(), 0, isServiceThere ? facts.st_gid : 0) != 0) return false;
   }
   if (::chmod(path_.c_str(), 0660) != 0 || ::listen(listening_->get(), kBacklog) != 0) return false;
-  source_ = loop_.addDescriptor(listening_->get(), EPOLLIN, [this](std::uint32_t) { acceptReady(); });
+  source_ = loop_.addDescriptor(listening_->get(), Interest::reading, [this](Readiness) { acceptReady(); });
   return source_ != nullptr;
 }
 
@@ -129,11 +128,11 @@ void StatusSocket::pause() {
   tick_ = loop_.addTimer(
       kPause, std::chrono::nanoseconds(0),
       [this] {
-        (void)source_->setEvents(EPOLLIN);
+        (void)source_->setInterest(Interest::reading);
         acceptReady();
       },
       [] {});
-  if (tick_ != nullptr) (void)source_->setEvents(0);
+  if (tick_ != nullptr) (void)source_->setInterest(Interest::none);
 }
 
 }  // namespace brenvik

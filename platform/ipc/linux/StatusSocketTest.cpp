@@ -3,7 +3,6 @@
 #include "platform/ipc/linux/StatusSocket.h"
 
 #include <gtest/gtest.h>
-#include <sys/epoll.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -54,9 +53,9 @@ class StatusSocketTest : public testing::Test {
     if (::connect(end.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) end.reset();
     return end;
   }
-  bool isWatched() const { return loop.eventsOf(socket->descriptor()) == EPOLLIN; }
+  bool isWatched() const { return loop.interestIn(socket->descriptor()) == Interest::reading; }
   void serve() {
-    if (isWatched()) (void)loop.makeReady(socket->descriptor(), EPOLLIN);
+    if (isWatched()) (void)loop.makeReady(socket->descriptor(), {.isReadable = true});
   }
   // What has come: a text, "" for the end, "nothing" while there is neither.
   static std::string received(const UniqueFd& end) {

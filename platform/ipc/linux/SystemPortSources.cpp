@@ -4,7 +4,6 @@
 
 #include <fcntl.h>
 #include <poll.h>
-#include <sys/epoll.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -149,7 +148,8 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
 
   bool addTo(RunLoop& loop) {
     loop_ = &loop;
-    source_ = loop.addDescriptor(fd_->get(), EPOLLIN, [this](std::uint32_t events) { ready(events); });
+    source_ =
+        loop.addDescriptor(fd_->get(), Interest::reading, [this](Readiness readiness) { ready(readiness); });
     return source_ != nullptr;
   }
 
@@ -180,13 +180,13 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
     fd_.reset();
   }
 
-  void ready(std::uint32_t events) noexcept {
+  void ready(Readiness readiness) noexcept {
     const auto keptAlive = shared_from_this();
-    if (pending_ != nullptr && !sendPending(events)) return;
+    if (pending_ != nullptr && !sendPending(readiness)) return;
     for (int taken = 0; taken < kMessageBudget && pending_ == nullptr && owner_ != nullptr; ++taken) {
       if (isDoor_ && !owner_->mayBeRead(*this)) {
         // Who has gone does not wait for an answer, nor keep the place of one who does.
-        if ((events & (EPOLLHUP | EPOLLERR)) != 0) return end();
+        if (readiness.isOver()) return end();
         isLimited_ = true;
         return pause();
       }
@@ -200,8 +200,7 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
       // nothing.
       if (answerWanted) break;
     }
-    if (owner_ != nullptr && pending_ == nullptr && (events & (EPOLLHUP | EPOLLERR)) != 0 &&
-        (events & EPOLLIN) == 0) {
+    if (owner_ != nullptr && pending_ == nullptr && readiness.isOver() && !readiness.isReadable) {
       end();  // nothing left to read, and nobody left to answer
     }
   }
@@ -214,14 +213,14 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
   }
 
   // Sends the reply that waited. True when the channel may be read again.
-  bool sendPending(std::uint32_t events) noexcept {
+  bool sendPending(Readiness readiness) noexcept {
     const Sent sent = sendReply(fd_->get(), *pending_);
     const bool waitsOn = sent == Sent::channelFull || (sent == Sent::noMemory && --retriesLeft_ > 0);
-    if (waitsOn && (events & (EPOLLHUP | EPOLLERR)) == 0 && waitToSend(sent)) return false;
+    if (waitsOn && !readiness.isOver() && waitToSend(sent)) return false;
     finish(*pending_);
     pending_.reset();
     retry_.reset();
-    if (sent == Sent::done && source_->setEvents(EPOLLIN)) return true;
+    if (sent == Sent::done && source_->setInterest(Interest::reading)) return true;
     end();
     return false;
   }
@@ -230,13 +229,13 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
   bool waitToSend(Sent sent) noexcept {
     if (sent != Sent::noMemory) {
       retry_.reset();
-      return source_->setEvents(EPOLLOUT);
+      return source_->setInterest(Interest::writing);
     }
-    if (!source_->setEvents(0)) return false;
+    if (!source_->setInterest(Interest::none)) return false;
     if (retry_ != nullptr) return true;
     try {
       retry_ = loop_->addTimer(
-          kRetryPause, kRetryPause, [this] { ready(0); }, [this] { end(); });
+          kRetryPause, kRetryPause, [this] { ready({}); }, [this] { end(); });
     } catch (const std::bad_alloc&) {
       return false;
     }
@@ -457,7 +456,8 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
     try {
       loop_ = &loop;
       (void)keepReserve();
-      source_ = loop.addDescriptor(listening_->get(), EPOLLIN, [this](std::uint32_t) { acceptReady(); });
+      source_ =
+          loop.addDescriptor(listening_->get(), Interest::reading, [this](Readiness) { acceptReady(); });
       return source_ != nullptr;
     } catch (const std::bad_alloc&) {
       return false;
@@ -525,8 +525,8 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
       reserve_ = {};  // the first one takes a descriptor
       const bool isInLine = ports_.closing().discardMessage(channel.descriptor(), channel.account(), token);
       if (isInLine && discardedSource_ == nullptr) {
-        discardedSource_ = loop_->addDescriptor(ports_.closing().readable(), EPOLLIN,
-                                                [this](std::uint32_t) { resumeDiscarded(); });
+        discardedSource_ = loop_->addDescriptor(ports_.closing().readable(), Interest::reading,
+                                                [this](Readiness) { resumeDiscarded(); });
       }
       (void)keepReserve();
       if (isInLine && discardedSource_ != nullptr) return true;
@@ -596,7 +596,9 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   }
 
   // The connection at the head of the queue would wake us for ever.
-  void pauseAccepting() noexcept { isAcceptingPaused_ = startTicking() && source_->setEvents(0); }
+  void pauseAccepting() noexcept {
+    isAcceptingPaused_ = startTicking() && source_->setInterest(Interest::none);
+  }
 
   void serve(UniqueFd connection) {
     // A connection made before the listening socket asked for credentials (a client that started this
@@ -621,7 +623,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
     }
     drop(books_.overdueAfter(*channel));
     // Its check-in is most often there already, and then needs no wake-up of its own.
-    channel->ready(EPOLLIN);
+    channel->ready({.isReadable = true});
   }
 
   // Closes a connection, if there is one to be closed.
@@ -661,7 +663,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
       }
     }
     if (std::exchange(isAcceptingPaused_, false)) {
-      (void)source_->setEvents(EPOLLIN);
+      (void)source_->setInterest(Interest::reading);
       acceptReady();
     }
   }
@@ -693,12 +695,12 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
 // Keeps its own hold on the send right: the name may be freed while the watch still waits for the hang-up.
 class SocketDeathWatch final : public DeathWatch {
  public:
-  SocketDeathWatch(PortName port, SystemPortSpace::SharedFd end, void* info) noexcept
-      : port_(port), end_(std::move(end)), info_(info) {}
+  SocketDeathWatch(PortName port, SystemPortSpace::SharedFd end) noexcept
+      : port_(port), end_(std::move(end)) {}
 
   bool addTo(RunLoop& loop) {
-    source_ = loop.addDescriptor(end_->get(), 0, [this](std::uint32_t events) {
-      if ((events & (EPOLLHUP | EPOLLERR)) != 0) died();
+    source_ = loop.addDescriptor(end_->get(), Interest::none, [this](Readiness readiness) {
+      if (readiness.isOver()) died();
     });
     return source_ != nullptr;
   }
@@ -712,7 +714,6 @@ class SocketDeathWatch final : public DeathWatch {
     callback_ = std::move(callback);
   }
   void invalidate() noexcept override { source_.reset(); }
-  void* info() const noexcept override { return info_; }
 
  private:
   void died() {
@@ -721,7 +722,6 @@ class SocketDeathWatch final : public DeathWatch {
   }
   const PortName port_;
   const SystemPortSpace::SharedFd end_;
-  void* const info_;
   std::function<void(DeathWatch&)> callback_;
   std::unique_ptr<DescriptorSource> source_;
 };
@@ -750,12 +750,11 @@ std::shared_ptr<RoutineSource> SystemPortSources::makeRoutineSource(PortName por
   }
 }
 
-std::shared_ptr<DeathWatch> SystemPortSources::makeDeathWatch(PortName port, RunLoop& loop,
-                                                              void* info) noexcept {
+std::shared_ptr<DeathWatch> SystemPortSources::makeDeathWatch(PortName port, RunLoop& loop) noexcept {
   auto end = ports_.sendEnd(port);
   if (end == nullptr) return nullptr;
   try {
-    auto watch = std::make_shared<SocketDeathWatch>(port, std::move(end), info);
+    auto watch = std::make_shared<SocketDeathWatch>(port, std::move(end));
     if (!watch->addTo(loop)) return nullptr;
     return watch;
   } catch (const std::bad_alloc&) {

@@ -29,7 +29,7 @@ class SystemPortSources final : public PortSources {
 
   std::shared_ptr<RoutineSource> makeRoutineSource(PortName port, const RoutineTable& table,
                                                    WantTrailer trailer) noexcept override;
-  std::shared_ptr<DeathWatch> makeDeathWatch(PortName port, RunLoop& loop, void* info) noexcept override;
+  std::shared_ptr<DeathWatch> makeDeathWatch(PortName port, RunLoop& loop) noexcept override;
 
  private:
   SystemPortSpace& ports_;

@@ -743,13 +743,11 @@ TEST_F(PortsTest, ARoutineMayInvalidateTheSourceThatCalledIt) {
 TEST_F(PortsTest, DeathOfThePortIsToldOnce) {
   auto [theirs, ours] = pair();
   const PortName name = ports.adoptSendRight(std::move(ours));
-  int info = 0;
-  const auto watch = sources.makeDeathWatch(name, *loop, &info);
+  const auto watch = sources.makeDeathWatch(name, *loop);
   ASSERT_NE(watch, nullptr);
   int told = 0;
   watch->setInvalidationCallback([&](DeathWatch& dead) {
     EXPECT_EQ(dead.port(), name);
-    EXPECT_EQ(dead.info(), &info);
     EXPECT_FALSE(dead.isValid());
     ++told;
   });
@@ -767,7 +765,7 @@ TEST_F(PortsTest, APortThatDiedBeforeItWasWatchedIsToldAfterTheCallbackIsSetAndA
   auto [theirs, ours] = pair();
   theirs.reset();
   const PortName name = ports.adoptSendRight(std::move(ours));
-  const auto watch = sources.makeDeathWatch(name, *loop, nullptr);
+  const auto watch = sources.makeDeathWatch(name, *loop);
   EXPECT_FALSE(watch->isValid());
   int told = 0;
   watch->setInvalidationCallback([&](DeathWatch&) { ++told; });
@@ -779,7 +777,7 @@ TEST_F(PortsTest, APortThatDiedBeforeItWasWatchedIsToldAfterTheCallbackIsSetAndA
 TEST_F(PortsTest, DeathIsToldWhereTheSameRightWasGivenTwiceAndRefusedOnce) {
   auto [theirs, ours] = pair();
   UniqueFd again(::fcntl(ours.get(), F_DUPFD_CLOEXEC, 0));
-  const auto watch = sources.makeDeathWatch(ports.adoptSendRight(std::move(ours)), *loop, nullptr);
+  const auto watch = sources.makeDeathWatch(ports.adoptSendRight(std::move(ours)), *loop);
   ASSERT_EQ(ports.deallocateSendRight(ports.adoptSendRight(std::move(again))), kern::success);
   int told = 0;
   watch->setInvalidationCallback([&](DeathWatch&) { ++told; });
@@ -805,7 +803,7 @@ TEST_F(PortsTest, ARightThatIsGivenUpStaysOpenForOthersWhoHoldTheSameSocket) {
 
 TEST_F(PortsTest, AnInvalidatedWatchTellsNothing) {
   auto [theirs, ours] = pair();
-  const auto watch = sources.makeDeathWatch(ports.adoptSendRight(std::move(ours)), *loop, nullptr);
+  const auto watch = sources.makeDeathWatch(ports.adoptSendRight(std::move(ours)), *loop);
   watch->setInvalidationCallback([](DeathWatch&) { ADD_FAILURE(); });
   watch->invalidate();
   theirs.reset();
@@ -814,7 +812,7 @@ TEST_F(PortsTest, AnInvalidatedWatchTellsNothing) {
 }
 
 TEST_F(PortsTest, AWatchOrSourceOnANameWithoutItsRightIsRefused) {
-  EXPECT_EQ(sources.makeDeathWatch(0x4242, *loop, nullptr), nullptr);
+  EXPECT_EQ(sources.makeDeathWatch(0x4242, *loop), nullptr);
   EXPECT_EQ(sources.makeRoutineSource(0x4242, table, WantTrailer::no), nullptr);
 }
 

@@ -2,8 +2,6 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/network/linux/NetworkAnswers.h"
 
-#include <sys/epoll.h>
-
 #include <algorithm>
 #include <array>
 #include <deque>
@@ -147,8 +145,8 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
       at->deadline = at->heard + question->limit;
       const auto interval = std::min(question->limit, longestSilence_ / 2);
       at->timer = loop_->makeTimer(interval, interval, kTimerLeeway, [this, at] { passed(at); });
-      at->source =
-          loop_->watchDescriptor(at->channel.descriptor(), EPOLLIN, [this, at](std::uint32_t) { read(at); });
+      at->source = loop_->watchDescriptor(at->channel.descriptor(), Interest::reading,
+                                          [this, at](Readiness) { read(at); });
       if (at->timer != nullptr && at->timer->activate() && at->source != nullptr) return;
     } catch (const std::bad_alloc&) {  // as below
     }

@@ -7,6 +7,7 @@
 #include <functional>
 #include <map>
 #include <memory>
+#include <optional>
 #include <string>
 #include <utility>
 #include <vector>
@@ -75,7 +76,7 @@ class ManualWorkQueue final : public WorkQueue {
   std::unique_ptr<Timer> makeTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
                                    std::chrono::nanoseconds leeway, Task handler) override;
   bool isCurrent() const noexcept override { return running_; }
-  std::unique_ptr<DescriptorSource> watchDescriptor(int, std::uint32_t, RunLoop::DescriptorHandler) override {
+  std::unique_ptr<DescriptorSource> watchDescriptor(int, Interest, RunLoop::DescriptorHandler) override {
     return nullptr;
   }
 
@@ -252,23 +253,23 @@ class ManualRunLoop final : public RunLoop {
     ++stops;
     stopped_ = true;
   }
-  std::unique_ptr<DescriptorSource> addDescriptor(int fd, std::uint32_t events,
+  std::unique_ptr<DescriptorSource> addDescriptor(int fd, Interest interest,
                                                   DescriptorHandler handler) override;
   std::unique_ptr<LoopSource> addTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
                                        std::function<void()> handler, std::function<void()> failed) override;
 
-  // Reports `events` on a watched descriptor; false when nobody watches it.
-  bool makeReady(int fd, std::uint32_t events) {
+  // Reports it on a watched descriptor; false when nobody watches it.
+  bool makeReady(int fd, Readiness readiness) {
     const auto it = descriptors_.find(fd);
     if (it == descriptors_.end()) return false;
     const auto handler = it->second.second;
-    handler(events);
+    handler(readiness);
     return true;
   }
-  // The interest in a watched descriptor; ~0 when nobody watches it.
-  std::uint32_t eventsOf(int fd) const {
+  // The interest in a watched descriptor; none when nobody watches it.
+  std::optional<Interest> interestIn(int fd) const {
     const auto it = descriptors_.find(fd);
-    return it == descriptors_.end() ? ~0U : it->second.first;
+    return it == descriptors_.end() ? std::nullopt : std::optional(it->second.first);
   }
   std::size_t timers() const noexcept { return timers_; }
 
@@ -284,7 +285,7 @@ class ManualRunLoop final : public RunLoop {
   class ManualDescriptor;
   class ManualTimer;
   ManualClock& clock_;
-  std::map<int, std::pair<std::uint32_t, DescriptorHandler>> descriptors_;
+  std::map<int, std::pair<Interest, DescriptorHandler>> descriptors_;
   std::size_t timers_ = 0;
   bool stopped_ = false;
 };
@@ -296,9 +297,9 @@ class ManualRunLoop::ManualDescriptor final : public DescriptorSource {
   void invalidate() noexcept override {
     if (std::exchange(valid_, false)) loop_.descriptors_.erase(fd_);
   }
-  bool setEvents(std::uint32_t events) noexcept override {
+  bool setInterest(Interest interest) noexcept override {
     if (!valid_) return false;
-    loop_.descriptors_[fd_].first = events;
+    loop_.descriptors_[fd_].first = interest;
     return true;
   }
 
@@ -340,10 +341,10 @@ class ManualRunLoop::ManualTimer final : public LoopSource {
   bool valid_ = true;
 };
 
-inline std::unique_ptr<DescriptorSource> ManualRunLoop::addDescriptor(int fd, std::uint32_t events,
+inline std::unique_ptr<DescriptorSource> ManualRunLoop::addDescriptor(int fd, Interest interest,
                                                                       DescriptorHandler handler) {
   if (refuseDescriptors) return nullptr;
-  descriptors_[fd] = {events, std::move(handler)};
+  descriptors_[fd] = {interest, std::move(handler)};
   return std::make_unique<ManualDescriptor>(*this, fd);
 }
 

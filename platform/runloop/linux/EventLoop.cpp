@@ -6,31 +6,25 @@
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <sys/timerfd.h>
-#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <climits>
+#include <ctime>
 #include <new>
 #include <utility>
 
+#include "platform/base/Clock.h"
 #include "platform/log/Log.h"
 
 namespace brenvik {
 namespace {
 
-// Counts while the system sleeps, as a person's idea of "ten seconds later" does.
-constexpr clockid_t kClock = CLOCK_BOOTTIME;
-
 constexpr std::uint64_t kNanosecondsASecond = 1'000'000'000;
 
-std::uint64_t nowNanoseconds() noexcept {
-  timespec now{};
-  ::clock_gettime(kClock, &now);
-  return static_cast<std::uint64_t>(now.tv_sec) * kNanosecondsASecond +
-         static_cast<std::uint64_t>(now.tv_nsec);
-}
+// The clock of the timers, CLOCK_BOOTTIME.
+std::uint64_t nowNanoseconds() noexcept { return static_cast<std::uint64_t>(timeSinceBoot().count()); }
 
 // Rounded up, so that nobody waits in a circle for the last fraction; the longest that can be said else.
 int toMilliseconds(std::uint64_t microseconds) noexcept {
@@ -41,6 +35,27 @@ int toMilliseconds(std::uint64_t microseconds) noexcept {
 
 std::uint64_t count(std::chrono::nanoseconds time) noexcept {
   return time.count() <= 0 ? 0 : static_cast<std::uint64_t>(time.count());
+}
+
+std::uint32_t eventsOf(Interest interest) noexcept {
+  switch (interest) {
+    case Interest::none:
+      return 0;
+    case Interest::reading:
+      return EPOLLIN;
+    case Interest::writing:
+      return EPOLLOUT;
+    case Interest::readingAndWriting:
+      return std::uint32_t{EPOLLIN} | std::uint32_t{EPOLLOUT};
+  }
+  return 0;
+}
+
+Readiness readinessOf(std::uint32_t events) noexcept {
+  return {.isReadable = (events & EPOLLIN) != 0,
+          .isWritable = (events & EPOLLOUT) != 0,
+          .hasHungUp = (events & EPOLLHUP) != 0,
+          .hasFailed = (events & EPOLLERR) != 0};
 }
 
 // Runs what a task or a source brought along. One that lacks memory and has not coped with that itself is
@@ -100,11 +115,11 @@ class EventLoop::DescriptorSet {
     epoll_.reset(::epoll_create1(EPOLL_CLOEXEC));
     return epoll_.isValid();
   }
-  bool control(int operation, Entry& entry, std::uint32_t events) noexcept {
-    epoll_event interest{};
-    interest.events = events;
-    interest.data.ptr = &entry;
-    return ::epoll_ctl(epoll_.get(), operation, entry.fd, &interest) == 0;
+  bool control(int operation, Entry& entry, Interest interest) noexcept {
+    epoll_event event{};
+    event.events = eventsOf(interest);
+    event.data.ptr = &entry;
+    return ::epoll_ctl(epoll_.get(), operation, entry.fd, &event) == 0;
   }
   int wait(epoll_event* ready, int most, int milliseconds) noexcept {
     const int count = ::epoll_wait(epoll_.get(), ready, most, milliseconds);
@@ -112,7 +127,7 @@ class EventLoop::DescriptorSet {
   }
   void handle(Entry* entry, std::uint32_t events) noexcept {
     ++entry->running;
-    run([entry, events] { entry->handler(events); });
+    run([entry, readiness = readinessOf(events)] { entry->handler(readiness); });
     if (--entry->running == 0 && entry->isRetired) delete entry;
   }
   // An entry whose handler runs lives until that returns.
@@ -132,17 +147,17 @@ class EventLoop::Descriptor final : public DescriptorSource {
       : set_(std::move(set)), entry_(new DescriptorSet::Entry{fd, std::move(handler)}) {}
   ~Descriptor() override { invalidate(); }
 
-  bool watch(std::uint32_t events) noexcept {
-    watched_ = set_->control(EPOLL_CTL_ADD, *entry_, events);
+  bool watch(Interest interest) noexcept {
+    watched_ = set_->control(EPOLL_CTL_ADD, *entry_, interest);
     return watched_;
   }
   const DescriptorSet::Entry* entry() const noexcept { return entry_.get(); }
   void invalidate() noexcept override {
-    if (std::exchange(watched_, false)) (void)set_->control(EPOLL_CTL_DEL, *entry_, 0);
+    if (std::exchange(watched_, false)) (void)set_->control(EPOLL_CTL_DEL, *entry_, Interest::none);
     if (entry_ != nullptr) set_->retire(std::move(entry_));
   }
-  bool setEvents(std::uint32_t events) noexcept override {
-    return watched_ && set_->control(EPOLL_CTL_MOD, *entry_, events);
+  bool setInterest(Interest interest) noexcept override {
+    return watched_ && set_->control(EPOLL_CTL_MOD, *entry_, interest);
   }
 
  private:
@@ -158,11 +173,12 @@ std::shared_ptr<EventLoop> EventLoop::make(For whom) try {
   if (!loop->descriptors_->make()) return nullptr;
   loop->wakeFd_.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
   if (!loop->wakeFd_.isValid()) return nullptr;
-  loop->wakeSource_ = loop->addDescriptor(loop->wakeFd_.get(), EPOLLIN, [raw = loop.get()](std::uint32_t) {
-    std::uint64_t count = 0;
-    (void)!::read(raw->wakeFd_.get(), &count, sizeof count);  // only to make it unreadable again
-    raw->drainInbox();
-  });
+  loop->wakeSource_ =
+      loop->addDescriptor(loop->wakeFd_.get(), Interest::reading, [raw = loop.get()](Readiness) {
+        std::uint64_t count = 0;
+        (void)!::read(raw->wakeFd_.get(), &count, sizeof count);  // only to make it unreadable again
+        raw->drainInbox();
+      });
   if (loop->wakeSource_ == nullptr) return nullptr;
   if (whom == For::anotherThread && !loop->makeClock()) return nullptr;
   return loop;
@@ -174,10 +190,10 @@ EventLoop::~EventLoop() = default;
 
 bool EventLoop::makeClock() {
   if (clockSource_ != nullptr) return true;
-  clockFd_.reset(::timerfd_create(kClock, TFD_CLOEXEC | TFD_NONBLOCK));
+  clockFd_.reset(::timerfd_create(CLOCK_BOOTTIME, TFD_CLOEXEC | TFD_NONBLOCK));
   if (!clockFd_.isValid()) return false;
-  auto source = std::make_unique<Descriptor>(descriptors_, clockFd_.get(), [](std::uint32_t) {});
-  if (!source->watch(EPOLLIN)) return false;
+  auto source = std::make_unique<Descriptor>(descriptors_, clockFd_.get(), [](Readiness) {});
+  if (!source->watch(Interest::reading)) return false;
   clockEntry_ = source->entry();
   clockSource_ = std::move(source);
   return true;
@@ -200,27 +216,34 @@ int EventLoop::runOnce(std::uint64_t timeOut) noexcept {
       if (count == -EINTR) return 0;
       if (count < 0) return count;
     }
-    if (count == 0) {
-      // The clock's descriptor may tell a moment later than the clock.
-      if (!hasOwnTasks_) return handleTimer() ? 1 : 0;
-      // Whoever has just got a reply goes first where there is one processor: it waited for that, not for
-      // this.
-      (void)::sched_yield();
-      drainInbox();
-      return 1;
-    }
-    if (ready.data.ptr == clockEntry_) {
-      // A descriptor that is ready at the same moment goes first: a check-in that has arrived beats the idle
-      // countdown. They are all ahead of the clock in the kernel's queue, which has put it at the end: when
-      // it comes round, each has had its turn.
-      if (!std::exchange(clockWasSeenDue_, true)) continue;
-      if (!handleTimer()) continue;
-    } else {
-      descriptors_->handle(static_cast<DescriptorSet::Entry*>(ready.data.ptr), ready.events);
-    }
+    if (count == 0) return handleOwn();
+    if (!handleReady(ready.data.ptr, ready.events)) continue;
     ownTasksAreNext_ = hasOwnTasks_;
     return 1;
   }
+}
+
+// No descriptor is ready: handles what the thread has posted to itself, else the timer that is due. 1 when
+// there was one, 0 when not.
+int EventLoop::handleOwn() noexcept {
+  // The clock's descriptor may tell a moment later than the clock.
+  if (!hasOwnTasks_) return handleTimer() ? 1 : 0;
+  // Whoever has just got a reply goes first where there is one processor: it waited for that, not for this.
+  (void)::sched_yield();
+  drainInbox();
+  return 1;
+}
+
+// Handles what epoll has reported. False when that was nothing yet.
+bool EventLoop::handleReady(void* entry, std::uint32_t events) noexcept {
+  if (entry != clockEntry_) {
+    descriptors_->handle(static_cast<DescriptorSet::Entry*>(entry), events);
+    return true;
+  }
+  // A descriptor that is ready at the same moment goes first: a check-in that has arrived beats the idle
+  // countdown. They are all ahead of the clock in the kernel's queue, which has put it at the end: when it
+  // comes round, each has had its turn.
+  return std::exchange(clockWasSeenDue_, true) && handleTimer();
 }
 
 // Sets the timerfd to the first timer. It is not read: being set makes it unreadable, too.
@@ -289,10 +312,10 @@ void EventLoop::drainInbox() noexcept {
   }
 }
 
-std::unique_ptr<DescriptorSource> EventLoop::addDescriptor(int fd, std::uint32_t events,
+std::unique_ptr<DescriptorSource> EventLoop::addDescriptor(int fd, Interest interest,
                                                            RunLoop::DescriptorHandler handler) {
   auto descriptor = std::make_unique<Descriptor>(descriptors_, fd, std::move(handler));
-  if (!descriptor->watch(events)) return nullptr;
+  if (!descriptor->watch(interest)) return nullptr;
   return descriptor;
 }
 

@@ -49,7 +49,7 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   bool onLoopThread() const noexcept;
 
   // Loop thread only.
-  std::unique_ptr<DescriptorSource> addDescriptor(int fd, std::uint32_t events,
+  std::unique_ptr<DescriptorSource> addDescriptor(int fd, Interest interest,
                                                   RunLoop::DescriptorHandler handler);
 
   // A timer that may be made, armed and destroyed on any thread. `failed` runs on the loop's thread when it
@@ -72,6 +72,8 @@ class EventLoop : public std::enable_shared_from_this<EventLoop> {
   void drainInbox() noexcept;
   bool makeClock();
   void setClock() noexcept;
+  int handleOwn() noexcept;
+  bool handleReady(void* entry, std::uint32_t events) noexcept;
   bool handleTimer() noexcept;
   bool arm(const std::shared_ptr<Timer>& timer) noexcept;
   void disarm(Timer& timer) noexcept;

@@ -4,7 +4,6 @@
 
 #include <fcntl.h>
 #include <pthread.h>
-#include <sys/epoll.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -95,9 +94,9 @@ class SystemQueue : public WorkQueue {
                                         inCurrentLogContext(std::move(handler)));
   }
   bool isCurrent() const noexcept override { return loop_->onLoopThread(); }
-  std::unique_ptr<DescriptorSource> watchDescriptor(int fd, std::uint32_t events,
+  std::unique_ptr<DescriptorSource> watchDescriptor(int fd, Interest interest,
                                                     RunLoop::DescriptorHandler handler) override {
-    return loop_->addDescriptor(fd, events, std::move(handler));
+    return loop_->addDescriptor(fd, interest, std::move(handler));
   }
 
  protected:
@@ -278,7 +277,7 @@ class PidfdExitSource final : public ProcessExitSource {
       // The id may have been given to another process between the caller's look and the opening.
       if (!state->pidfd.isValid() || processStartTime(state->pid) != state->startTime) return tell(state);
       try {
-        state->source = loop->addDescriptor(state->pidfd.get(), EPOLLIN, [state](std::uint32_t) {
+        state->source = loop->addDescriptor(state->pidfd.get(), Interest::reading, [state](Readiness) {
           state->source.reset();
           tell(state);
         });
@@ -381,9 +380,9 @@ void SystemRunLoop::stop() noexcept {
   loop_->wake();
 }
 
-std::unique_ptr<DescriptorSource> SystemRunLoop::addDescriptor(int fd, std::uint32_t events,
+std::unique_ptr<DescriptorSource> SystemRunLoop::addDescriptor(int fd, Interest interest,
                                                                DescriptorHandler handler) {
-  return loop_->addDescriptor(fd, events, std::move(handler));
+  return loop_->addDescriptor(fd, interest, std::move(handler));
 }
 
 std::unique_ptr<LoopSource> SystemRunLoop::addTimer(std::chrono::nanoseconds first,

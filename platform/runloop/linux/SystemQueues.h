@@ -20,7 +20,7 @@ class SystemRunLoop final : public RunLoop {
 
   RunResult run(std::chrono::duration<double> timeOut, ReturnAfterSource returnAfterSource) override;
   void stop() noexcept override;
-  std::unique_ptr<DescriptorSource> addDescriptor(int fd, std::uint32_t events,
+  std::unique_ptr<DescriptorSource> addDescriptor(int fd, Interest interest,
                                                   DescriptorHandler handler) override;
   std::unique_ptr<LoopSource> addTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
                                        std::function<void()> handler, std::function<void()> failed) override;

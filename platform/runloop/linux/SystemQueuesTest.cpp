@@ -7,7 +7,6 @@
 #include <linux/filter.h>
 #include <linux/seccomp.h>
 #include <signal.h>
-#include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <sys/prctl.h>
 #include <sys/resource.h>
@@ -54,8 +53,8 @@ TEST_F(SystemQueuesTest, ReturnsAfterASourceWasHandled) {
   const UniqueFd read(pipe[0]);
   const UniqueFd write(pipe[1]);
   int handled = 0;
-  const auto source = loop->addDescriptor(read.get(), EPOLLIN, [&](std::uint32_t events) {
-    EXPECT_TRUE(events & EPOLLIN);
+  const auto source = loop->addDescriptor(read.get(), Interest::reading, [&](Readiness readiness) {
+    EXPECT_TRUE(readiness.isReadable);
     char byte = 0;
     EXPECT_EQ(::read(read.get(), &byte, 1), 1);
     ++handled;
@@ -70,7 +69,7 @@ TEST_F(SystemQueuesTest, WhatTheLoopPostsToItselfAndDescriptorsTakeTurns) {
   const UniqueFd ready(::eventfd(1, EFD_CLOEXEC));  // never read: always ready
   ASSERT_TRUE(ready.isValid());
   int served = 0;
-  const auto source = loop->addDescriptor(ready.get(), EPOLLIN, [&](std::uint32_t) { ++served; });
+  const auto source = loop->addDescriptor(ready.get(), Interest::reading, [&](Readiness) { ++served; });
   SystemQueues queues(*loop);
   std::vector<int> servedBefore;
   std::function<void()> again = [&] {
@@ -129,7 +128,7 @@ TEST_F(SystemQueuesTest, ADescriptorThatIsReadyIsServedBeforeATimerThatIsDue) {
   std::string order;
   const auto timer = loop->addTimer(0s, 0s, [&] { order += 't'; }, {});
   std::unique_ptr<DescriptorSource> source;
-  source = loop->addDescriptor(read.get(), EPOLLIN, [&](std::uint32_t) {
+  source = loop->addDescriptor(read.get(), Interest::reading, [&](Readiness) {
     order += 'd';
     source.reset();
   });
@@ -143,7 +142,7 @@ TEST_F(SystemQueuesTest, ADescriptorIsServedBeforeATimerThatWasDueWhenItBecameRe
   std::string order;
   const auto timer = loop->addTimer(500ms, 0s, [&] { order += 't'; }, {});
   std::unique_ptr<DescriptorSource> source;
-  source = loop->addDescriptor(ready.get(), EPOLLIN, [&](std::uint32_t) {
+  source = loop->addDescriptor(ready.get(), Interest::reading, [&](Readiness) {
     order += 'd';
     source.reset();
   });
@@ -160,9 +159,9 @@ TEST_F(SystemQueuesTest, DescriptorsThatAreAlwaysReadyTakeTurns) {
   const UniqueFd second(::eventfd(1, EFD_CLOEXEC));
   const UniqueFd third(::eventfd(1, EFD_CLOEXEC));
   std::array<int, 3> served{};
-  const auto a = loop->addDescriptor(first.get(), EPOLLIN, [&](std::uint32_t) { ++served[0]; });
-  const auto b = loop->addDescriptor(second.get(), EPOLLIN, [&](std::uint32_t) { ++served[1]; });
-  const auto c = loop->addDescriptor(third.get(), EPOLLIN, [&](std::uint32_t) { ++served[2]; });
+  const auto a = loop->addDescriptor(first.get(), Interest::reading, [&](Readiness) { ++served[0]; });
+  const auto b = loop->addDescriptor(second.get(), Interest::reading, [&](Readiness) { ++served[1]; });
+  const auto c = loop->addDescriptor(third.get(), Interest::reading, [&](Readiness) { ++served[2]; });
   for (int i = 0; i < 30; ++i) (void)loop->run(0s, ReturnAfterSource::yes);
   EXPECT_EQ(served, (std::array{10, 10, 10}));
 }
@@ -173,14 +172,14 @@ TEST_F(SystemQueuesTest, AHandlerMayEndItsOwnWatchingAndThatOfAnotherThatIsReady
   int served = 0;
   std::unique_ptr<DescriptorSource> a;
   std::unique_ptr<DescriptorSource> b;
-  const auto endBoth = [&](std::uint32_t) {
+  const auto endBoth = [&](Readiness) {
     ++served;
     a.reset();
     b.reset();
     EXPECT_EQ(loop->run(0s, ReturnAfterSource::no), RunResult::timedOut) << "nothing is watched any more";
   };
-  a = loop->addDescriptor(first.get(), EPOLLIN, endBoth);
-  b = loop->addDescriptor(second.get(), EPOLLIN, endBoth);
+  a = loop->addDescriptor(first.get(), Interest::reading, endBoth);
+  b = loop->addDescriptor(second.get(), Interest::reading, endBoth);
   EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::handledSource);
   EXPECT_EQ(served, 1);
 }
@@ -200,7 +199,7 @@ TEST_F(SystemQueuesTest, ATimerThatIsMadeOrCancelledWhileAnotherRunsDownIsHeeded
     std::unique_ptr<LoopSource> never = loop->addTimer(5 * unit, 0s, [&] { order += 'n'; }, {});
     std::unique_ptr<DescriptorSource> source;
     (void)loop->run(0s, ReturnAfterSource::no);  // both run down now
-    source = loop->addDescriptor(ready.get(), EPOLLIN, [&](std::uint32_t) {
+    source = loop->addDescriptor(ready.get(), Interest::reading, [&](Readiness) {
       order += 'd';
       never.reset();
       isInTime = isInTime && isBefore(5);
@@ -223,8 +222,8 @@ TEST_F(SystemQueuesTest, ATimerThatIsDueHasItsTurnBetweenDescriptorsThatAreAlway
   const UniqueFd first(::eventfd(1, EFD_CLOEXEC));
   const UniqueFd second(::eventfd(1, EFD_CLOEXEC));
   int served = 0;
-  const auto a = loop->addDescriptor(first.get(), EPOLLIN, [&](std::uint32_t) { ++served; });
-  const auto b = loop->addDescriptor(second.get(), EPOLLIN, [&](std::uint32_t) { ++served; });
+  const auto a = loop->addDescriptor(first.get(), Interest::reading, [&](Readiness) { ++served; });
+  const auto b = loop->addDescriptor(second.get(), Interest::reading, [&](Readiness) { ++served; });
   int ticks = 0;
   const auto timer = loop->addTimer(0s, 1ns, [&] { ++ticks; }, {});
   for (int i = 0; i < 3000; ++i) (void)loop->run(0s, ReturnAfterSource::yes);
@@ -309,9 +308,9 @@ TEST_F(SystemQueuesTest, AHandlerThatRunsTheLoopMayLoseItsSourceMeanwhile) {
   std::string order;
   std::unique_ptr<DescriptorSource> a;
   std::unique_ptr<DescriptorSource> b;
-  a = loop->addDescriptor(first.get(), EPOLLIN,
-                          [&, kept = std::make_shared<std::string>("a")](std::uint32_t) {
-                            b = loop->addDescriptor(second.get(), EPOLLIN, [&](std::uint32_t) {
+  a = loop->addDescriptor(first.get(), Interest::reading,
+                          [&, kept = std::make_shared<std::string>("a")](Readiness) {
+                            b = loop->addDescriptor(second.get(), Interest::reading, [&](Readiness) {
                               order += 'b';
                               a.reset();
                               b.reset();
@@ -408,10 +407,11 @@ TEST_F(SystemQueuesTest,
   SystemQueues queues(*loop);
   const auto lackMemory = [] { throw std::bad_alloc(); };
   const UniqueFd ready(::eventfd(1, EFD_CLOEXEC));
-  std::unique_ptr<DescriptorSource> source = loop->addDescriptor(ready.get(), EPOLLIN, [&](std::uint32_t) {
-    source.reset();
-    lackMemory();
-  });
+  std::unique_ptr<DescriptorSource> source =
+      loop->addDescriptor(ready.get(), Interest::reading, [&](Readiness) {
+        source.reset();
+        lackMemory();
+      });
   bool isDone = false;
   queues.main().post(lackMemory);
   queues.main().postAfter(1ms, lackMemory);

@@ -32,20 +32,29 @@
 #include "platform/plist/PropertyListCodec.h"
 #include "platform/security/linux/Sha256.h"
 
-// Calls of this program that a test may let fail. None of the opens here makes a file.
-extern "C" ssize_t read(int fd, void* bytes, std::size_t size) {
+// Calls of this program that a test may let fail. None of the opens here makes a file. Only the symbols have
+// the names of the C library: where its headers check sizes (_FORTIFY_SOURCE), they define functions of these
+// names.
+extern "C" {
+ssize_t failingRead(int fd, void* bytes, std::size_t size) __asm__("read");
+ssize_t failingGetdents64(int fd, void* bytes, std::size_t size) noexcept __asm__("getdents64");
+int failingLstat(const char* path, struct stat* facts) noexcept __asm__("lstat");
+int failingOpenat(int directory, const char* path, int flags, ...) __asm__("openat");
+
+ssize_t failingRead(int fd, void* bytes, std::size_t size) {
   return brenvik::FailingCall::failsNow("read") ? -1 : ::syscall(SYS_read, fd, bytes, size);
 }
-extern "C" ssize_t getdents64(int fd, void* bytes, std::size_t size) noexcept {
+ssize_t failingGetdents64(int fd, void* bytes, std::size_t size) noexcept {
   return brenvik::FailingCall::failsNow("getdents64") ? -1 : ::syscall(SYS_getdents64, fd, bytes, size);
 }
-extern "C" int lstat(const char* path, struct stat* facts) noexcept {
+int failingLstat(const char* path, struct stat* facts) noexcept {
   if (brenvik::FailingCall::failsNow("lstat")) return -1;
   return static_cast<int>(::syscall(SYS_newfstatat, AT_FDCWD, path, facts, AT_SYMLINK_NOFOLLOW));
 }
-extern "C" int openat(int directory, const char* path, int flags, ...) {
+int failingOpenat(int directory, const char* path, int flags, ...) {
   if (brenvik::FailingCall::failsNow("openat")) return -1;
   return static_cast<int>(::syscall(SYS_openat, directory, path, flags, 0));
+}
 }
 
 namespace brenvik {

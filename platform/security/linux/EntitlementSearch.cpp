@@ -501,6 +501,48 @@ std::vector<std::string> entitlementDirectories() {
   return parts;
 }
 
+namespace {
+
+// What the findings say of one file.
+struct Nearness {
+  const EntitlementFinding* blame = nullptr;  // the first key that differs or is wrong
+  int faults = 0;                             // how many there are of these
+  int passed = 0;                             // keys before the first of them
+  bool namesCaller = false;                   // its executable is the caller's
+  bool hasName = true;                        // it has the entitlement
+
+  void add(const EntitlementFinding& each) {
+    if (each.kind == Kind::holds && blame == nullptr) ++passed;
+    if (each.kind == Kind::holds && each.key == "Executable") namesCaller = true;
+    if (each.kind != Kind::differs && each.kind != Kind::wrong) return;
+    if (each.key == "Entitlements" && each.kind == Kind::differs) hasName = false;
+    if (blame == nullptr) blame = &each;
+    ++faults;
+  }
+  // The fewest keys that differ; among those, one that names the caller's executable; among those, the key
+  // that is compared last.
+  bool isNearerThan(const Nearness& other) const noexcept {
+    if (other.blame == nullptr) return true;
+    if (faults != other.faults) return faults < other.faults;
+    if (namesCaller != other.namesCaller) return namesCaller;
+    return passed > other.passed;
+  }
+};
+
+// The file that came nearest to giving the entitlement; one without blame when none came near.
+Nearness nearestFile(const std::vector<EntitlementFinding>& findings) {
+  Nearness best;
+  for (std::size_t i = 0; i < findings.size();) {
+    Nearness file;
+    const std::string& path = findings[i].path;
+    for (; i < findings.size() && findings[i].path == path; ++i) file.add(findings[i]);
+    if (file.blame != nullptr && file.hasName && file.isNearerThan(best)) best = file;
+  }
+  return best;
+}
+
+}  // namespace
+
 std::string whyNotEntitled(const EntitlementSearch::Result& result,
                            const std::vector<EntitlementFinding>& findings) {
   if (result.error) {
@@ -509,42 +551,11 @@ std::string whyNotEntitled(const EntitlementSearch::Result& result,
     return (cause == findings.rend() ? std::string("a file") : cause->path) + " cannot be examined now";
   }
   if (result.value.asBoolean() == true) return result.file + " gives it by now";
-  if (result.value) {
-    return result.file + " gives it as " + valueInWords(result.value);
-  }
-  // The fewest keys that differ; among those, one that names the caller's executable; among those, the key
-  // that is compared last.
-  struct File {
-    const EntitlementFinding* blame = nullptr;
-    int faults = 0;
-    int passed = 0;  // before the first that differs
-    bool namesCaller = false;
-    bool hasName = true;
-  };
-  const auto isBetter = [](const File& a, const File& b) {
-    if (a.faults != b.faults) return a.faults < b.faults;
-    if (a.namesCaller != b.namesCaller) return a.namesCaller;
-    return a.passed > b.passed;
-  };
-  File best;
-  for (std::size_t i = 0; i < findings.size();) {
-    File file;
-    const std::string& path = findings[i].path;
-    for (; i < findings.size() && findings[i].path == path; ++i) {
-      const EntitlementFinding& each = findings[i];
-      if (each.kind == Kind::holds && file.blame == nullptr) ++file.passed;
-      if (each.kind == Kind::holds && each.key == "Executable") file.namesCaller = true;
-      if (each.kind != Kind::differs && each.kind != Kind::wrong) continue;
-      if (each.key == "Entitlements" && each.kind == Kind::differs) file.hasName = false;
-      if (file.blame == nullptr) file.blame = &each;
-      ++file.faults;
-    }
-    if (file.blame == nullptr || !file.hasName) continue;
-    if (best.blame == nullptr || isBetter(file, best)) best = file;
-  }
-  if (best.blame == nullptr) return "no file names it";
-  if (best.blame->key.empty()) return best.blame->path + " is passed over: " + best.blame->text;
-  return best.blame->path + " came nearest, but its " + best.blame->key + ' ' + best.blame->text;
+  if (result.value) return result.file + " gives it as " + valueInWords(result.value);
+  const EntitlementFinding* const blame = nearestFile(findings).blame;
+  if (blame == nullptr) return "no file names it";
+  if (blame->key.empty()) return blame->path + " is passed over: " + blame->text;
+  return blame->path + " came nearest, but its " + blame->key + ' ' + blame->text;
 }
 
 }  // namespace brenvik

@@ -57,6 +57,67 @@ void goUp(std::string* place) {
   place->erase(place->rfind('/') == std::string::npos ? 0 : place->rfind('/'));
 }
 
+// One walk along a path. A step returns false when it has ended the walk, whose result is then in at_.
+class Walk {
+ public:
+  explicit Walk(const std::string& path) : path_(path), rest_(path) {}
+
+  TrustedPath run() {
+    if (!lookAt(at_.place)) return std::move(at_);
+    for (std::string name = takeComponent(&rest_); !name.empty(); name = takeComponent(&rest_)) {
+      if (!stepTo(name)) return std::move(at_);
+    }
+    if (path_.ends_with('/') && !S_ISDIR(at_.facts.st_mode)) {
+      (void)fail(ENOTDIR);
+    } else {
+      (void)end(TrustedPath::Outcome::trusted, at_.place);
+    }
+    return std::move(at_);
+  }
+
+ private:
+  // Goes one component further.
+  bool stepTo(const std::string& name) {
+    if (!S_ISDIR(at_.facts.st_mode)) return fail(ENOTDIR);
+    // Judged before anything in it is looked up, and only as a folder above.
+    if (!isFolderToTrust(at_.facts)) return end(TrustedPath::Outcome::untrusted, at_.place);
+    if (name == ".") return true;
+    std::string next = at_.place;
+    name == ".." ? goUp(&next) : void(next += '/' + name);
+    if (!lookAt(next)) return false;
+    if (S_ISLNK(at_.facts.st_mode)) return stepThroughLink(next);
+    at_.place = std::move(next);
+    return true;
+  }
+
+  bool stepThroughLink(const std::string& link) {
+    if (at_.facts.st_uid != 0) return end(TrustedPath::Outcome::untrusted, link);
+    if (++links_ > kMaxLinks) return fail(ELOOP);
+    const ssize_t size = followLink(link, &rest_);
+    if (size <= 0) return fail(size == 0 ? ENOENT : errno);
+    if (rest_.front() == '/') at_.place.clear();
+    return lookAt(at_.place);
+  }
+
+  bool lookAt(const std::string& place) {
+    return ::lstat(place.empty() ? "/" : place.c_str(), &at_.facts) == 0 || fail(errno);
+  }
+  bool fail(int error) {
+    at_ = withError(error);
+    return false;
+  }
+  bool end(TrustedPath::Outcome outcome, const std::string& place) {
+    at_.outcome = outcome;
+    at_.place = place.empty() ? "/" : place;
+    return false;
+  }
+
+  const std::string& path_;
+  std::string rest_;  // of the path, links on the way replaced by what they lead to
+  int links_ = 0;
+  TrustedPath at_;
+};
+
 }  // namespace
 
 bool isRootsAlone(const struct stat& facts) noexcept {
@@ -65,47 +126,6 @@ bool isRootsAlone(const struct stat& facts) noexcept {
 
 // By path and not by descriptors, which would cost three times as many system calls at each check-in: what
 // was found to be root's alone, nobody else can exchange before the next look.
-TrustedPath walkTrustedPath(const std::string& path) {
-  TrustedPath at;
-  const auto lookAt = [&at](const std::string& place) {
-    return ::lstat(place.empty() ? "/" : place.c_str(), &at.facts) == 0;
-  };
-  if (!lookAt(at.place)) return withError(errno);
-  std::string rest = path;
-  int links = 0;
-  for (;;) {
-    const std::string name = takeComponent(&rest);
-    if (name.empty()) break;
-    if (!S_ISDIR(at.facts.st_mode)) return withError(ENOTDIR);
-    // Judged before anything in it is looked up, and only as a folder above.
-    if (!isFolderToTrust(at.facts)) {
-      at.outcome = TrustedPath::Outcome::untrusted;
-      if (at.place.empty()) at.place = "/";
-      return at;
-    }
-    if (name == ".") continue;
-    std::string next = at.place;
-    name == ".." ? goUp(&next) : void(next += '/' + name);
-    if (!lookAt(next)) return withError(errno);
-    if (!S_ISLNK(at.facts.st_mode)) {
-      at.place = std::move(next);
-      continue;
-    }
-    if (at.facts.st_uid != 0) {
-      at.outcome = TrustedPath::Outcome::untrusted;
-      at.place = std::move(next);
-      return at;
-    }
-    if (++links > kMaxLinks) return withError(ELOOP);
-    const ssize_t size = followLink(next, &rest);
-    if (size <= 0) return withError(size == 0 ? ENOENT : errno);
-    if (rest.front() == '/') at.place.clear();
-    if (!lookAt(at.place)) return withError(errno);
-  }
-  if (path.ends_with('/') && !S_ISDIR(at.facts.st_mode)) return withError(ENOTDIR);
-  at.outcome = TrustedPath::Outcome::trusted;
-  if (at.place.empty()) at.place = "/";
-  return at;
-}
+TrustedPath walkTrustedPath(const std::string& path) { return Walk(path).run(); }
 
 }  // namespace brenvik

@@ -4,7 +4,6 @@
 
 #include <curl/curl.h>
 #include <strings.h>
-#include <sys/epoll.h>
 #include <sys/socket.h>
 
 #include <algorithm>
@@ -405,16 +404,15 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
         driver.sockets_.erase(fd);
         return 0;
       }
-      const std::uint32_t events = ((what & CURL_POLL_IN) != 0 ? std::uint32_t{EPOLLIN} : 0U) |
-                                   ((what & CURL_POLL_OUT) != 0 ? std::uint32_t{EPOLLOUT} : 0U);
+      const Interest interest = interestIn((what & CURL_POLL_IN) != 0, (what & CURL_POLL_OUT) != 0);
       auto& source = driver.sockets_[fd];
-      if (source != nullptr && source->setEvents(events)) return 0;
+      if (source != nullptr && source->setInterest(interest)) return 0;
       if (source == nullptr) {
-        source = driver.loop_->watchDescriptor(fd, events, [&driver, fd](std::uint32_t ready) {
+        source = driver.loop_->watchDescriptor(fd, interest, [&driver, fd](Readiness ready) {
           int mask = 0;
-          if ((ready & (EPOLLIN | EPOLLHUP)) != 0) mask |= CURL_CSELECT_IN;
-          if ((ready & EPOLLOUT) != 0) mask |= CURL_CSELECT_OUT;
-          if ((ready & EPOLLERR) != 0) mask |= CURL_CSELECT_ERR;
+          if (ready.isReadable || ready.hasHungUp) mask |= CURL_CSELECT_IN;
+          if (ready.isWritable) mask |= CURL_CSELECT_OUT;
+          if (ready.hasFailed) mask |= CURL_CSELECT_ERR;
           driver.act(fd, mask);
         });
         if (source != nullptr) return 0;

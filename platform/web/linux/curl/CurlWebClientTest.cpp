@@ -55,9 +55,9 @@ class ShortQueue final : public WorkQueue {
     return real_->makeTimer(first, interval, leeway, std::move(handler));
   }
   bool isCurrent() const noexcept override { return real_->isCurrent(); }
-  std::unique_ptr<DescriptorSource> watchDescriptor(int fd, std::uint32_t events,
+  std::unique_ptr<DescriptorSource> watchDescriptor(int fd, Interest interest,
                                                     RunLoop::DescriptorHandler handler) override {
-    return refusals_.descriptors ? nullptr : real_->watchDescriptor(fd, events, std::move(handler));
+    return refusals_.descriptors ? nullptr : real_->watchDescriptor(fd, interest, std::move(handler));
   }
 
  private:

@@ -17,7 +17,7 @@ class RadioLogging {
 
   // Logging to file on for any `enable` but 0, off for 0. Always kern::success: whether the radio manager
   // heard it is not known.
-  KernelReturn BVMobileHelperEnableRadioManagerLogs(PortName port, std::int32_t enable) noexcept;
+  KernelReturn enableRadioManagerLogs(PortName port, std::int32_t enable) noexcept;
 
  private:
   RadioManager& radio_;
