@@ -261,14 +261,14 @@ std::string labelKey(const std::string& label) {
 using LabelsRoutine = decltype(&BVMobileHelperCopyBadgeLabels);
 
 Outcome askForLabels(const char* name, LabelsRoutine routine, bvmh_client* client,
-                     std::vector<PropertyList> labels, const Values& values) {
+                     const std::vector<PropertyList>& labels, const Values& values) {
   if (labels.empty()) throw UsageError{"no label given"};
   std::vector<PropertyList> languages;
   for (const auto& [parameter, value] : values.all()) {
     if (parameter == "--language") languages.push_back(valueOfType("string", value));
   }
-  const std::string labelBytes = serialized(PropertyList::array(std::move(labels)));
-  const std::string languageBytes = serialized(PropertyList::array(std::move(languages)));
+  const std::string labelBytes = serialized(PropertyList::array(labels));
+  const std::string languageBytes = serialized(PropertyList::array(languages));
   bvmh_region region{};
   const std::int32_t connected = bvmh_connect(client);
   const std::int32_t code = connected != BVMH_OK
@@ -305,8 +305,7 @@ Outcome showBadges(bvmh_client* client, const Values& values) {
       labels.push_back(valueOfType("string", value));
     }
   }
-  return askForLabels("BVMobileHelperCopyBadgeLabels", BVMobileHelperCopyBadgeLabels, client,
-                      std::move(labels), values);
+  return askForLabels("BVMobileHelperCopyBadgeLabels", BVMobileHelperCopyBadgeLabels, client, labels, values);
 }
 
 Outcome showLocalizedLabels(bvmh_client* client, const Values& values) {
@@ -314,8 +313,8 @@ Outcome showLocalizedLabels(bvmh_client* client, const Values& values) {
   for (const auto& [parameter, value] : values.all()) {
     if (parameter == "--label") labels.push_back(valueOfType("string", labelKey(value)));
   }
-  return askForLabels("BVMobileHelperCopyLocalizedLabels", BVMobileHelperCopyLocalizedLabels, client,
-                      std::move(labels), values);
+  return askForLabels("BVMobileHelperCopyLocalizedLabels", BVMobileHelperCopyLocalizedLabels, client, labels,
+                      values);
 }
 
 namespace {
