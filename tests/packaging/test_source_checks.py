@@ -45,11 +45,11 @@ class Checks(unittest.TestCase):
 
     def test_an_internal_header_of_another_folder(self):
         self.write("platform/a/Own.cpp", LICENCE + '#include "platform/a/internal/Reader.h"\n')
-        self.assertNotIn("internal headers", self.run_check("check-source", "--quick")[1])
+        self.assertNotIn("internal headers from", self.run_check("check-source", "--quick")[1])
         self.write("tools/Foreign.cpp", LICENCE + '#include "platform/a/internal/Reader.h"\n')
         told = self.complaints("check-source", "--quick")
-        self.assertIn("internal headers of another folder:\ntools/Foreign.cpp:2:", told)
-        self.assertNotIn("Own.cpp", told.split("internal headers")[1])
+        self.assertIn("includes of internal headers from outside their folder:\ntools/Foreign.cpp:2:", told)
+        self.assertNotIn("Own.cpp", told.split("outside their folder")[1])
 
     def test_a_file_that_a_page_names_and_that_is_not_there(self):
         self.write("README.md", "`platform/a/A.cpp`, `platform/a/A`, `A.cpp`, `platform/{a,b}/A.cpp`, `/etc/none.plist`, `platform/*/A.cpp`\n"
