@@ -53,12 +53,15 @@ class Checks(unittest.TestCase):
 
     def test_a_file_that_a_page_names_and_that_is_not_there(self):
         self.write("README.md", "`platform/a/A.cpp`, `platform/a/A`, `A.cpp`, `platform/{a,b}/A.cpp`, `/etc/none.plist`, `platform/*/A.cpp`\n"
-                                "and `platform/a/Gone.cpp`, `Gone.h`\n")
+                                "and `platform/a/Gone.cpp`, `Gone.h`, platform/a/A.cpp, platform/b/B.cpp.\n")
+        self.write("platform/a/A.cpp", LICENCE + "// See docs/decisions/" "99-gone.md.\n")
         told = self.complaints("check-names")
         found = [line for line in told.splitlines() if "README.md:" in line and "there is no" in line]
         self.assertEqual(found, ["check-names: README.md:1: there is no platform/{a,b}/A.cpp",
                                  "check-names: README.md:2: there is no platform/a/Gone.cpp",
-                                 "check-names: README.md:2: there is no Gone.h"])
+                                 "check-names: README.md:2: there is no Gone.h",
+                                 "check-names: README.md:2: there is no platform/b/B.cpp"])
+        self.assertIn("check-names: platform/a/A.cpp: there is no docs/decisions/" "99-gone.md\n", told)
 
     @unittest.skipUnless(shutil.which("dpkg"), "packages are Debian's")
     def test_a_package_that_nothing_uses_or_that_no_page_explains(self):
