@@ -37,7 +37,7 @@ std::span<const Command> commandTable();
 // "prefs set"
 std::string wordsOf(const Command& command);
 
-// All of it as the parser, the help, the completions and the manual page see it.
+// The whole table in the form that the parser, the help, the completions and the manual page use.
 ProgramSyntax programSyntax();
 
 }  // namespace brenvik::tools

@@ -16,7 +16,7 @@ namespace brenvik::tools {
 
 // What a command has done.
 struct Outcome {
-  const char* routine = "";     // the one that was called
+  const char* routine = "";     // name of the routine that was called
   std::int32_t code = BVMH_OK;  // its result
   bool isDone = true;           // false: it answered that the work failed
   std::string text;             // for people: lines, on success
