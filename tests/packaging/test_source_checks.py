@@ -124,10 +124,13 @@ class Checks(unittest.TestCase):
         build = self.tree / "build" / "dev"
         build.mkdir(parents=True)
         (build / "compile_commands.json").write_text(json.dumps([
-            {"directory": str(self.tree), "file": name, "command": f"c++ -std=c++20 -I{self.tree} -c {name}"}
+            {"directory": str(self.tree), "file": name, "command": f"c++ -std=c++20 -I{build}/views/platform_a -c {name}"}
             for name in ("platform/a/A.cpp", "platform/a/B.cpp", "platform/a/User.cpp")]))
         self.write(".gitignore", "/build/\n")
         self.write("platform/a/Header.h", LICENCE)
+        view = build / "views" / "platform_a" / "platform" / "a"
+        view.mkdir(parents=True)
+        (view / "Header.h").symlink_to(self.tree / "platform" / "a" / "Header.h")
         self.write("platform/a/User.cpp", LICENCE + '#include "platform/a/Header.h"\n')
         self.write("platform/a/B.cpp", LICENCE + COMPLEX.format(name="old"))
         git("init", "-q", "-b", "main")
