@@ -18,7 +18,7 @@ import sys
 
 sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "man"))
 import pages as manual_pages  # noqa: E402: the log messages' reader
-from plots import plots  # noqa: E402
+from plots import plots, sections  # noqa: E402
 
 FENCE = re.compile(r"^\s*(`{3,}|~{3,})")
 LINK = re.compile(r"(!?\[[^\]]*\])\(([^)\s#]*)(#[^)\s]*)?\)")
@@ -52,8 +52,11 @@ class Handbook:
         self.write_log_messages()
         self.write_changelog()
         self.write_drawings()
-        for name, svg in plots(self.tree / "benchmarks" / "results.tsv").items():
+        results = self.tree / "benchmarks" / "results.tsv"
+        for name, svg in plots(results).items():
             self.write(f"drawings/{name}.svg", svg)
+        page = self.output / "benchmarks.md"
+        self.write("benchmarks.md", re.sub(r"^<!-- plots:.*-->$", lambda _: sections(results), page.read_text(encoding="utf-8"), flags=re.M))
         # What pages include or show.
         shutil.copytree(self.tree / "client" / "examples", self.output / "examples")
         for stray in (self.output / "examples").rglob("README.md"):

@@ -3,6 +3,20 @@
 """Draws what was measured, as bars beside a line at what it was measured against."""
 import html
 
+# What a page says of a group: heading, sentence. A group that is not here has its own name as heading.
+HEADINGS = {
+    "transport": ("Starting and calling", 'From a start to the first reply, and a call. "Bare" is the least that a program of the same kind '
+                  "can do: the same sockets, the same sizes, no daemon behind."),
+    "library": ("The client library", "What the C library adds to a call."),
+    "python": ("Python", "A call of the Python package beside a bare exchange from Python, and its import."),
+    "command": ("The command line", "bvhelperctl as a process of its own."),
+    "preferences": ("Preferences and tokens", "A value that is set is on the disk when the call returns."),
+    "location": ("Location and labels", "Look-ups in the offline gazetteer."),
+    "formats": ("Formats", "Property lists, and what is made of them."),
+    "fetch": ("Fetching", "A database over HTTPS, in the network worker."),
+    "files": ("Files", "Archives, copies and moves."),
+}
+
 ROW, BAR, LEFT, WIDTH = 46, 12, 8, 620
 
 
@@ -23,6 +37,15 @@ def read(path):
 def plots(path):
     """{name of the drawing: SVG}"""
     return {f"benchmark-{group}": plot(group, rows) for group, rows in read(path).items()}
+
+
+def sections(path):
+    """What a page has of each group, as Markdown that shows the drawings of plots()."""
+    parts = []
+    for group in read(path):
+        heading, sentence = HEADINGS.get(group, (group.capitalize(), ""))
+        parts.append(f"## {heading}\n\n{sentence}\n\n```{{raw}} html\n:file: drawings/benchmark-{group}.svg\n```\n")
+    return "\n".join(parts)
 
 
 def plot(group, rows):

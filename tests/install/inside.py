@@ -31,7 +31,10 @@ SERVICE = "brenvik-mobile-helper.service"
 SOCKET = "brenvik-mobile-helper.socket"
 PATH = "/run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper"
 WORKERS = {"network": PATH + ".network", "store": PATH + ".stores"}
+HELPER = "/usr/libexec/brenvik/BrenvikMobileHelper"
 IDLE = 10.0
+CIVIC_PUSH, ADDRESS_PUSH = 'country "NO", city "Oslo"', 'address "203.0.113.9"'
+UPDATE_NOTICE = 'notification "com.norvale.lasd.UpdateAvailable"'
 
 
 def run(*command, check=True, **more):
@@ -208,7 +211,8 @@ def names(**addresses):
 
 @contextlib.contextmanager
 def web_server(host, files):
-    """Serves {path: content} by HTTPS at 127.0.0.1, with a certificate that this system trusts meanwhile."""
+    """Serves {path: content} by HTTPS at 127.0.0.1, with a certificate that this system trusts meanwhile. A content may be a
+    function that returns it, as late as it likes."""
     certificate, key = pathlib.Path("/run/brenvik-test.crt"), pathlib.Path("/run/brenvik-test.key")
     run("openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt", "ec_paramgen_curve:P-256", "-nodes", "-days", "2",
         "-subj", "/CN=test", "-addext", f"subjectAltName=DNS:{host}", "-keyout", key, "-out", certificate)
@@ -219,6 +223,8 @@ def web_server(host, files):
     class Handler(http.server.BaseHTTPRequestHandler):
         def do_GET(self):  # as the base class has it
             content = files.get(self.path)
+            if callable(content):
+                content = content()
             self.send_response(404 if content is None else 200)
             self.send_header("Content-Type", "application/gzip" if self.path.endswith(".gz") else "application/xml")
             self.send_header("Content-Length", str(len(content or b"")))
@@ -247,22 +253,25 @@ def web_server(host, files):
 
 @contextlib.contextmanager
 def stun_server(seen_as):
-    """Answers one Binding request at 127.0.0.1 with this address."""
+    """Answers Binding requests at 127.0.0.1 with this address."""
     with socket.socket(socket.AF_INET, socket.SOCK_DGRAM) as server:
         server.bind(("127.0.0.1", 3478))
-        server.settimeout(20)
+        server.settimeout(0.1)
+        ended = threading.Event()
 
         def serve():
-            with contextlib.suppress(TimeoutError):
-                request, sender = server.recvfrom(2048)
-                mapped = bytes(a ^ b for a, b in zip(socket.inet_aton(seen_as), request[4:8]))
-                server.sendto(b"\1\1\0\x0c" + request[4:20] + b"\0\x20\0\x08\0\1\0\0" + mapped, sender)
+            while not ended.is_set():
+                with contextlib.suppress(TimeoutError):
+                    request, sender = server.recvfrom(2048)
+                    mapped = bytes(a ^ b for a, b in zip(socket.inet_aton(seen_as), request[4:8]))
+                    server.sendto(b"\1\1\0\x0c" + request[4:20] + b"\0\x20\0\x08\0\1\0\0" + mapped, sender)
 
         thread = threading.Thread(target=serve)
         thread.start()
         try:
             yield
         finally:
+            ended.set()
             thread.join()
 
 
@@ -731,8 +740,10 @@ def the_handbook_is_whole():
     expect_equal([each for each in pages if not os.path.exists(each)], [], "links that lead nowhere")
 
 
-def a_telephony_daemon_without_rights_lives_with_it():
-    """The handbook's page "Integrate a telephony daemon", command by command."""
+@contextlib.contextmanager
+def telephony_daemon():
+    """The daemon of the handbook's page "Integrate a telephony daemon", installed and started command by command. Gives a
+    function that returns what it has printed."""
     example = "/usr/share/doc/libbrenvik-mobile-helper-dev/examples/brenvikd"
     here = {"apt": None,  # the packages are installed, by this very test
             "cc": "install -D -m 755 /test/brenvikd /usr/libexec/brenvikd"}  # compiled outside, with the same command
@@ -741,23 +752,10 @@ def a_telephony_daemon_without_rights_lives_with_it():
     made = [] if os.path.exists("/etc/sysusers.d") else ["/etc/sysusers.d"]
     for folder in made:
         os.mkdir(folder)
+    began = f"@{time.time():.6f}"
     for command in filter(None, commands):
         run("/bin/sh", "-ec", command, cwd=example)
-
-    def told():
-        return run("journalctl", "-u", "brenvikd.service", "-o", "cat").stdout
-
-    wait_for(lambda: 'country "NO", city "Oslo"' in told(), "the push of where it is")
-    expect_equal(property_of("brenvikd.service", "User"), "brenvikd")
-    # The helper goes, as for an upgrade; the daemon asks again, and is told again.
-    run("systemctl", "stop", SERVICE)
-    run("systemctl", "kill", "--signal=SIGUSR1", "brenvikd.service")
-    wait_for(lambda: told().count('country "NO", city "Oslo"') == 2, "a second push, from another helper")
-    with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as updater:
-        updater.connect("/run/brenvik/bootstrap/com.norvale.Brenvik.lasd")
-        updater.send(struct.pack("<6I", 0, 24, 0, 0, 0, 0)
-                     + plistlib.dumps({"Notification": "com.norvale.lasd.NoUpdateRequired"}, fmt=plistlib.FMT_BINARY))
-    wait_for(lambda: 'notification "com.norvale.lasd.NoUpdateRequired"' in told(), "the notification")
+    yield lambda: run("journalctl", "-u", "brenvikd.service", "-o", "cat", "--since", began).stdout
     units = ("brenvikd.socket", "brenvikd-lasd.socket", "brenvikd.service")
     run("systemctl", "stop", *units)
     run("rm", "/usr/libexec/brenvikd", "/etc/sysusers.d/brenvikd.conf", "/etc/brenvik/entitlements.d/60-brenvikd.plist",
@@ -765,6 +763,25 @@ def a_telephony_daemon_without_rights_lives_with_it():
     run("systemctl", "daemon-reload")
     for folder in made:
         os.rmdir(folder)
+
+
+def ask_the_telephony_daemon_to_ask():
+    run("systemctl", "kill", "--signal=SIGUSR1", "brenvikd.service")
+
+
+def a_telephony_daemon_without_rights_lives_with_it():
+    with telephony_daemon() as told:
+        wait_for(lambda: CIVIC_PUSH in told(), "the push of where it is")
+        expect_equal(property_of("brenvikd.service", "User"), "brenvikd")
+        # The helper goes; the daemon asks again, and is told again.
+        run("systemctl", "stop", SERVICE)
+        ask_the_telephony_daemon_to_ask()
+        wait_for(lambda: told().count(CIVIC_PUSH) == 2, "a second push, from another helper")
+        with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as updater:
+            updater.connect("/run/brenvik/bootstrap/com.norvale.Brenvik.lasd")
+            updater.send(struct.pack("<6I", 0, 24, 0, 0, 0, 0)
+                         + plistlib.dumps({"Notification": "com.norvale.lasd.NoUpdateRequired"}, fmt=plistlib.FMT_BINARY))
+        wait_for(lambda: 'notification "com.norvale.lasd.NoUpdateRequired"' in told(), "the notification")
 
 
 def journal_explains():
@@ -933,18 +950,119 @@ def comes_back_after_a_limit():
     hit_a_limit("trigger-limit-hit", service="[Unit]\nStartLimitBurst=1000\n", socket="[Socket]\nTriggerLimitIntervalSec=60s\nTriggerLimitBurst=5\n")
 
 
-def upgrade():
+def version_of(package):
+    return run("dpkg-deb", "-f", package, "Version").stdout.strip()
+
+
+def install_the_next_version():
+    """Returns what the package manager printed."""
+    return run("dpkg", "-i", *glob.glob("/packages/upgrade/*.deb"), env={**os.environ, "DEBIAN_FRONTEND": "noninteractive"}).stdout
+
+
+class AsksOn:
+    """A client that asks over and over, on a channel of its own for each question."""
+
+    def __enter__(self):
+        self.library, self.codes, self.ended = Library(), [], False
+        self.thread = threading.Thread(target=self._ask)
+        self.thread.start()
+        return self
+
+    def __exit__(self, *_):
+        self.ended = True
+        self.thread.join()
+
+    def _ask(self):
+        while not self.ended:
+            self.codes.append(self.library.request(PATH))
+            time.sleep(0.02)
+
+
+def upgrade_under_a_living_telephony_daemon():
+    """All packages get a higher version while the daemon is connected, a database is on its way, and another client asks on.
+    The daemon is told everything before, meanwhile and afterwards; the helper that was replaced is named until it has
+    left."""
+    host, content = "lasd.norvale.example", b"of tomorrow\n" * 1000
+    manifest = {"umts": {"Version": "2.0", "ContentURL": f"https://{host}/umts.db.gz"}}
+    asked_for, may_go_on = threading.Event(), threading.Event()
+
+    def database():
+        asked_for.set()
+        may_go_on.wait(60)
+        return gzip.compress(content)
+
+    files = {"/1/v3/lasd.plist": plistlib.dumps(manifest), "/umts.db.gz": database}
+    before, after = (version_of(glob.glob(f"/packages/{folder}brenvik-mobile-helper_*.deb")[0]) for folder in ("", "upgrade/"))
     ping_sockets = pathlib.Path("/proc/sys/net/ipv4/ping_group_range")
     ping_sockets.write_text("0 7")
-    with Library().connected(PATH):
-        process = property_of(SERVICE, "MainPID")
-        run("dpkg", "-i", "/packages/upgrade.deb")
+    with contextlib.ExitStack() as stack:
+        stack.enter_context(names(lasd_norvale_example="127.0.0.1", stun_norvale_example="127.0.0.1"))
+        stack.enter_context(web_server(host, files))
+        stack.callback(may_go_on.set)  # or the server waits for it, when a check below has failed
+        stack.enter_context(stun_server("203.0.113.9"))
+        told = stack.enter_context(telephony_daemon())
+        pushes = {CIVIC_PUSH: 0, ADDRESS_PUSH: 0, UPDATE_NOTICE: 0}
+
+        def expect_push(line):
+            pushes[line] += 1
+            wait_for(lambda: told().count(line) == pushes[line], f"{line}, number {pushes[line]}")
+
+        expect_push(CIVIC_PUSH)  # it asks when it starts
+        bvhelperctl("location", "wan-ip")
+        expect_push(ADDRESS_PUSH)
+        bvhelperctl("lasd", "check", "--type", "umts")
+        expect(asked_for.wait(20), "the database is asked for")
+        helper = property_of(SERVICE, "MainPID")
+        worker = property_of("brenvik-network-worker.service", "MainPID")
+        expect(int(worker) > 0, "the network worker is at work")
+
+        with AsksOn() as client:
+            printed = install_the_next_version()
+        expect_equal(set(client.codes), {(0, "a-token")}, f"each of {len(client.codes)} requests meanwhile")
+        expect(len(client.codes) >= 5, f"only {len(client.codes)} requests meanwhile")
         expect_equal(property_of(SOCKET, "ActiveState"), "active", "listens on")
         workers_listen()
-        expect_equal(property_of(SERVICE, "MainPID"), process, "a helper at work is left alone")
+        expect_equal(property_of(SERVICE, "MainPID"), helper, "a helper at work is left alone")
+        expect_equal(property_of("brenvik-network-worker.service", "MainPID"), worker, "a worker at work is left alone")
+        for text in (f"process {helper}", "replaced", "bvhelperctl status", f"systemctl stop {SERVICE}"):
+            expect(text in printed, f"the package manager does not print: {text}\n{printed}")
+
+        # Nothing of what was under way is lost, and the old helper goes on.
+        may_go_on.set()
+        expect_push(UPDATE_NOTICE)
+        expect_equal(pathlib.Path("/var/mobile/Library/LASD/umts.db").read_bytes(), content)
+        ask_the_telephony_daemon_to_ask()
+        expect_push(CIVIC_PUSH)
+        bvhelperctl("location", "wan-ip")
+        expect_push(ADDRESS_PUSH)
+        status = json.loads(bvhelperctl("--json", "status").stdout)
+        expect_equal((status["pid"], status["version"], status["installed"], status["restartPending"]),
+                     (int(helper), before, after, True), "status")
+        expect(f"restart pending: version {before} runs, version {after} is installed" in bvhelperctl("status").stderr,
+               "status says what is pending")
+
+        # Its clients allow it: the daemon lets go of its channel, and ten seconds later the helper leaves by itself.
+        run("systemctl", "stop", "brenvikd.service")
+        wait_for(lambda: property_of(SERVICE, "ActiveState") == "inactive", "the old helper leaves", IDLE + 10)
+        expect_equal((property_of(SERVICE, "Result"), property_of(SERVICE, "ExecMainStatus")), ("success", "0"))
+        run("systemctl", "start", "brenvikd.service")
+        expect_push(CIVIC_PUSH)
+        process = property_of(SERVICE, "MainPID")
+        expect(process != helper and os.path.samefile(f"/proc/{process}/exe", HELPER), "the program that is installed runs")
+
+        # Under a daemon that never lets go it is ended when it has nothing to do. The daemon does not notice.
+        daemon = property_of("brenvikd.service", "MainPID")
+        expect("runs on" in install_the_next_version(), "reinstalled, and told about as well")
+        wait_for(lambda: json.loads(bvhelperctl("--json", "status").stdout)["busyTokens"] == 0, "nothing to do")
+        run("systemctl", "stop", SERVICE)
+        ask_the_telephony_daemon_to_ask()
+        expect_push(CIVIC_PUSH)
+        bvhelperctl("location", "wan-ip")
+        expect_push(ADDRESS_PUSH)
+        expect(os.path.samefile(f"/proc/{property_of(SERVICE, 'MainPID')}/exe", HELPER), "the program that is installed runs")
+        expect_equal(property_of("brenvikd.service", "MainPID"), daemon, "it is the same daemon")
     expect_equal(ping_sockets.read_text().split(), ["0", "7"], "ping sockets that the administrator has opened")
     expect_equal(run("dpkg", "-V", *PACKAGES, check=False).stdout, "", "dpkg --verify")
-    expect_equal(bvhelperctl("voicemail", "token").stdout, "a-token\n")
     expect(os.path.exists("/etc/brenvik/entitlements.d/50-bvhelperctl.plist"), "entitlements stay")
 
 
@@ -959,9 +1077,10 @@ def upgrade_from_a_version_without_workers():
     with Library().connected(PATH):
         process = property_of(SERVICE, "MainPID")
         pathlib.Path("/proc/sys/net/ipv4/ping_group_range").write_text("0 0")  # as it left it
-        run("dpkg", "-i", *(each for each in glob.glob("/packages/*_*.deb") if "/brenvik-mobile-helper_" in each))
+        printed = run("dpkg", "-i", *glob.glob("/packages/upgrade/brenvik-mobile-helper_*.deb")).stdout
         workers_listen()
         expect_equal(property_of(SERVICE, "MainPID"), process, "a helper at work is left alone")
+        expect(f"process {process}" in printed, f"the helper that was replaced is not named\n{printed}")
         expect_equal(bvhelperctl("voicemail", "token").stdout, "a-token\n", "the helper that was there finds the new worker")
     expect_equal(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").read_text().split(), ["0", "2147483647"], "ping sockets")
 
@@ -1004,7 +1123,8 @@ def main():
              only_root_reaches_a_worker,
              other_accounts_are_told_apart, the_handbook_is_whole, a_telephony_daemon_without_rights_lives_with_it,
              journal_explains, tells_what_keeps_it, leaves_when_idle_and_comes_back,
-             a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit, upgrade,
+             a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit,
+             upgrade_under_a_living_telephony_daemon,
              upgrade_from_a_version_without_workers, remove, purge]
     for step in steps:
         began = time.monotonic()

@@ -4,13 +4,13 @@
 
 #include <string>
 
-// What to do about it, for more than one command.
+// Advice that more than one command gives.
 namespace brenvik::tools {
 
 // "root", or "user 1234" where the account has no name.
 std::string accountOfThisProcess();
 
-// When the account may not connect to a socket of the helper's.
+// For an account that may not connect to a socket of the helper.
 std::string groupAdvice();
 
 }  // namespace brenvik::tools

@@ -13,7 +13,7 @@ namespace brenvik::tools {
 
 bool isCompletionRequest(int argc, const char* const* argv);
 
-// Prints what there is, a name a line; names that a shell could not take as one plain word are left out.
+// Prints the names, one a line. A name that a shell could not take as one plain word is left out.
 ExitStatus printOffers(int argc, const char* const* argv);
 
 }  // namespace brenvik::tools

@@ -9,8 +9,8 @@
 // Helpers that run, as /proc shows them to everybody (proc(5)).
 namespace brenvik::tools {
 
-// The content of a file of the kernel's, empty when it cannot be read. Not by streams: with them the program
-// carries all of the library's locales, and each start of any command is slower by a fifth.
+// Returns the content of a file in /proc or /sys; empty when it cannot be read. Not by streams: with them the
+// program carries all of the library's locales, and each start of any command is slower by a fifth.
 std::string factsIn(const std::filesystem::path& path);
 
 // The words of the first line that begins with `name`; "" stands for the very first line.

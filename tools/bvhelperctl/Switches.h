@@ -2,7 +2,8 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
-#include "tools/bvhelperctl/CommandTable.h"
+#include "tools/bvhelperctl/Outcome.h"
+#include "tools/support/Parameters.h"
 
 // The two switches. The helper answers that it switched whatever comes of it; these look for what would make
 // the switch idle, as far as it can be seen from here, and add notes.

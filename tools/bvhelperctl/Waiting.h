@@ -2,7 +2,8 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
-#include "tools/bvhelperctl/CommandTable.h"
+#include "tools/bvhelperctl/Outcome.h"
+#include "tools/support/Parameters.h"
 
 // Requests whose answer goes to the telephony daemon later. With --wait they take its place first, ask, and
 // show the answer.

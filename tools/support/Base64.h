@@ -13,7 +13,7 @@ namespace brenvik::tools {
 
 // RFC 4648, section 4, with padding.
 std::string toBase64(std::span<const std::byte> bytes);
-// White space is skipped; nothing for anything else that RFC 4648 does not allow.
+// White space is skipped. Returns nothing for input that RFC 4648 does not allow.
 std::optional<std::vector<std::byte>> fromBase64(std::string_view text);
 
 }  // namespace brenvik::tools

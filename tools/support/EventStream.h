@@ -14,7 +14,7 @@
 
 namespace brenvik::tools {
 
-// A point in time after which nobody waits any longer; none: never.
+// A deadline. Without a time it never ends.
 class Patience {
  public:
   explicit Patience(std::optional<double> seconds);

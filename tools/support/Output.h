@@ -10,16 +10,16 @@
 // Standard output, checked to the last byte, and what is only for a person at a terminal.
 namespace brenvik::tools {
 
-// To be called first of all. A standard stream that is closed gets a descriptor that fails, so that no socket
+// Call this first. A standard stream that is closed gets a descriptor that fails, so that no socket
 // or file of ours takes its number; a reader that has gone is an error to be told, not the end of the
 // process.
 void prepareStandardStreams() noexcept;
 
-// Writes to standard output, which is buffered. False, then and ever after, when something was lost.
+// Writes to standard output, which is buffered. Returns false when something was lost, and from then on.
 bool printOut(std::string_view text) noexcept;
-// Brings everything out. False as above.
+// Flushes. Returns false as printOut does.
 bool flushOutput() noexcept;
-// Brings everything out and gives the exit status: `status`, or outputLost instead of done, told on standard
+// Flushes and returns the exit status: `status`, or outputLost instead of done. A loss is told on standard
 // error in the name of `program`.
 int finishOutput(const char* program, ExitStatus status) noexcept;
 

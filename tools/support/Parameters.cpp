@@ -29,6 +29,44 @@ std::string contentOfStream(std::FILE* stream, const std::string& name) {
   return content;
 }
 
+// What a value is, when it is not what its parameter wants: for "NAME: ... is not WHAT". Empty when it is.
+std::string missedBy(const Parameter& parameter, const std::string& given) {
+  const auto isBetween = [&](double least, double most) {
+    const auto number = numberIn<double>(given);
+    return number && *number >= least && *number <= most;
+  };
+  const auto unless = [](bool isRight, const char* what) { return isRight ? "" : what; };
+  switch (parameter.kind) {
+    case ValueKind::text:
+      return unless(isValidUtf8(given), "UTF-8");
+    case ValueKind::bytes:
+      return "";
+    case ValueKind::path:
+      return unless(!given.empty(), "a path");
+    case ValueKind::latitude:
+      return unless(isBetween(-90, 90), "a latitude, -90 to 90");
+    case ValueKind::longitude:
+      return unless(isBetween(-180, 180), "a longitude, -180 to 180");
+    case ValueKind::integer:
+      return unless(numberIn<std::int32_t>(given).has_value(), "an integer of 32 bits");
+    case ValueKind::count:
+      return unless(numberIn<std::int32_t>(given).value_or(0) >= 1, "a number of at least 1");
+    case ValueKind::user:
+      return unless(numberIn<std::uint32_t>(given).has_value(), "a user's number");
+    case ValueKind::seconds:
+      // As milliseconds they must fit 32 bits.
+      return unless(isBetween(0.001, 4'000'000), "a number of seconds, 0.001 to 4000000");
+    case ValueKind::choice:
+      break;
+  }
+  std::string all;
+  for (const char* each : parameter.choices) {
+    if (given == each) return "";
+    all += std::string(all.empty() ? "" : ", ") + each;
+  }
+  return "one of: " + all;
+}
+
 }  // namespace
 
 const std::string* Values::find(std::string_view name) const {
@@ -38,61 +76,22 @@ const std::string* Values::find(std::string_view name) const {
 }
 
 std::string checkedValue(const Parameter& parameter, const std::string& given, bool isSecret) {
+  const std::string name = std::string(parameter.name) + ": ";
   const auto wrong = [&](const std::string& what) {
-    const std::string shown = isSecret ? "what was read" : '"' + printable(given) + '"';
-    return UsageError{std::string(parameter.name) + ": " + shown + " is not " + what};
+    return UsageError{name + (isSecret ? "what was read" : '"' + printable(given) + '"') + " is not " + what};
   };
-  const auto isBetween = [&](double least, double most) {
-    const auto number = numberIn<double>(given);
-    return number && *number >= least && *number <= most;
-  };
+  if (const std::string what = missedBy(parameter, given); !what.empty()) throw wrong(what);
+  // Every text but a value's own travels as a C string.
+  if (parameter.kind == ValueKind::text && given.find('\0') != std::string::npos)
+    throw UsageError{name + "a NUL cannot be part of it"};
   std::string value = given;
-  switch (parameter.kind) {
-    case ValueKind::text:
-      if (!isValidUtf8(given)) throw wrong("UTF-8");
-      // Every text but a value's own travels as a C string.
-      if (given.find('\0') != std::string::npos)
-        throw UsageError{std::string(parameter.name) + ": a NUL cannot be part of it"};
-      break;
-    case ValueKind::bytes:
-      break;
-    case ValueKind::path: {
-      std::error_code error;
-      if (given.empty()) throw wrong("a path");
-      value = std::filesystem::absolute(given, error).string();
-      if (error) throw wrong("a path from here: " + error.message());
-      break;
-    }
-    case ValueKind::latitude:
-      if (!isBetween(-90, 90)) throw wrong("a latitude, -90 to 90");
-      break;
-    case ValueKind::longitude:
-      if (!isBetween(-180, 180)) throw wrong("a longitude, -180 to 180");
-      break;
-    case ValueKind::integer:
-      if (!numberIn<std::int32_t>(given)) throw wrong("an integer of 32 bits");
-      break;
-    case ValueKind::count:
-      if (numberIn<std::int32_t>(given).value_or(0) < 1) throw wrong("a number of at least 1");
-      break;
-    case ValueKind::user:
-      if (!numberIn<std::uint32_t>(given)) throw wrong("a user's number");
-      break;
-    case ValueKind::seconds:
-      // As milliseconds they must fit 32 bits.
-      if (!isBetween(0.001, 4'000'000)) throw wrong("a number of seconds, 0.001 to 4000000");
-      break;
-    case ValueKind::choice:
-      if (std::none_of(parameter.choices.begin(), parameter.choices.end(),
-                       [&](const char* each) { return given == each; })) {
-        std::string all;
-        for (const char* each : parameter.choices) all += std::string(all.empty() ? "" : ", ") + each;
-        throw wrong("one of: " + all);
-      }
-      break;
+  if (parameter.kind == ValueKind::path) {
+    std::error_code error;
+    value = std::filesystem::absolute(given, error).string();
+    if (error) throw wrong("a path from here: " + error.message());
   }
   if (parameter.limit != 0 && value.size() > parameter.limit) {
-    throw UsageError{std::string(parameter.name) + ": at most " + std::to_string(parameter.limit) + " bytes"};
+    throw UsageError{name + "at most " + std::to_string(parameter.limit) + " bytes"};
   }
   return value;
 }
@@ -134,6 +133,7 @@ Values checkedValues(const std::vector<Parameter>& positionals, const std::vecto
   Values values;
   ValueReader reader;
   const bool isLiteral = given.has("--literal");
+  const char* readAsEmpty = nullptr;
   for (const auto& [name, value] : given.all()) {
     const auto named = [&name = name](const Parameter& each) { return name == each.name; };
     auto parameter = std::find_if(positionals.begin(), positionals.end(), named);
@@ -141,7 +141,13 @@ Values checkedValues(const std::vector<Parameter>& positionals, const std::vecto
     const bool isElsewhere =
         parameter->source == ValueSource::argumentOrFile && !isLiteral && ValueReader::standsElsewhere(value);
     const std::string text = isElsewhere ? reader.read(parameter->name, value, LastNewline::drop) : value;
+    if (isElsewhere && text.empty() && readAsEmpty == nullptr) readAsEmpty = parameter->name;
     values.add(name, checkedValue(*parameter, text, isElsewhere));
+  }
+  // More likely a program before the pipe that failed than an empty value that somebody wants.
+  if (readAsEmpty != nullptr) {
+    throw UsageError{std::string(readAsEmpty) + ": what was read is empty",
+                     "An empty value is given as an argument: \"\"."};
   }
   return values;
 }

@@ -93,7 +93,7 @@ std::optional<Number> numberIn(std::string_view text) {
 // What was read from elsewhere may be a secret: a message then does not repeat it.
 std::string checkedValue(const Parameter& parameter, const std::string& given, bool isSecret = false);
 
-// Precondition: there is one.
+// Precondition: one of the parameters has this name.
 const Parameter& parameterNamed(const std::vector<Parameter>& parameters, std::string_view name);
 
 // The number in a value that checkedValue has let through.

@@ -295,6 +295,17 @@ class Input(ToolTest):
         self.assertEqual(err, "bvhelperctl: TOKEN: a NUL cannot be part of it\n")
         self.assertEqual(self.fake.requests, [])
 
+    def test_nothing_to_read_is_an_error_and_not_an_empty_value(self):
+        self.file.write_text("\n")
+        for arguments, name in [(["set-token", "-"], "TOKEN"), (["set-token", f"@{self.file}"], "TOKEN"),
+                                (["set-token", "--key", "-", "T"], "--key")]:
+            with self.subTest(arguments=arguments):
+                _, err = self.run_tool("voicemail", *arguments, status=2, given="")
+                self.assertEqual(err, f"bvhelperctl: {name}: what was read is empty\n"
+                                      'An empty value is given as an argument: "".\n')
+        self.assertEqual(self.fake.requests, [])
+        self.assertEqual(self.asked(self.fake, "voicemail", "set-token", "").text(32, 256), "")
+
     def test_a_closed_standard_input_is_an_error(self):
         done = subprocess.run(["sh", "-c", f'exec "{BUILD}/bvhelperctl" --socket "$1" voicemail set-token - <&-', "sh",
                                self.socket], capture_output=True, text=True, timeout=60)
