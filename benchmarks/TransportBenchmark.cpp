@@ -535,6 +535,8 @@ int main(int argc, char** argv) {
   }
   pinToOneProcessor();
   const Entitlement entitlement;
+  // As the installed system has it, or the daemon's last words of its start would be that it is missing.
+  std::filesystem::create_directories(std::filesystem::path(bvmh_service_socket()).parent_path());
   const std::string bare = self().parent_path() / "BareServer";
   const std::string daemon = self().parent_path().parent_path() / "BrenvikMobileHelper";
   const auto isWanted = [only](std::string_view part) { return only.empty() || only == part; };
