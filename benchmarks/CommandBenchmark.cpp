@@ -32,7 +32,7 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-constexpr double kMostOfFloor = 1.3;
+constexpr double kMaxRatioToFloor = 1.3;
 constexpr const char* kProgram = BRENVIK_BUILD_DIRECTORY "/bvhelperctl";
 constexpr const char* kDaemon = BRENVIK_BUILD_DIRECTORY "/BrenvikMobileHelper";
 
@@ -111,7 +111,7 @@ int benchmark() {
         }},
        {"/bin/true", [] { return timeOf([] { run("/bin/true", nullptr); }); }},
        {"a bare call", [] { return timeOf([] { require(call(), "the daemon does not answer"); }); }}},
-      {{.ours = 0, .peer = 1, .most = kMostOfFloor}});
+      {{.ours = 0, .peer = 1, .most = kMaxRatioToFloor}});
   ::kill(daemon, SIGTERM);
   (void)::waitpid(daemon, nullptr, 0);  // how it ends is for other tests
   return good ? 0 : 1;

@@ -40,8 +40,8 @@ constexpr std::int32_t kOneUnifiedLine = 4;
 constexpr std::int32_t kOneBsdLine = 5;
 // With everything on one processor this is the price of waking another thread: see
 // docs/decisions/12-location-hand-over.md.
-constexpr double kMostOfAnEmptyRequest = 3.0;
-constexpr double kMostOfALookUp = 100;  // microseconds, for 99 of 100
+constexpr double kMaxRatioToEmptyRequest = 3.0;
+constexpr double kMaxLookUp = 100;  // microseconds, for 99 of 100
 
 class GeoServiceNeverAnswers final : public GeoService {
  public:
@@ -159,7 +159,7 @@ bool compareRequests(int pairs) {
                                              }}};
   constexpr int kTurn = 100;
   return comparePaired({.rounds = std::max(1, pairs / kTurn), .unmeasured = 5, .measured = kTurn},
-                       contestants, {{2, 1, kMostOfAnEmptyRequest}, {4, 3, kMostOfAnEmptyRequest}});
+                       contestants, {{2, 1, kMaxRatioToEmptyRequest}, {4, 3, kMaxRatioToEmptyRequest}});
 }
 
 bool measureLookUps(const char* path, int count) {
@@ -224,11 +224,11 @@ bool measureLookUps(const char* path, int count) {
   }
   const double median = quantile(times, 0.5);
   const double slow = quantile(times, 0.99);
-  const bool within = slow < kMostOfALookUp;
+  const bool within = slow < kMaxLookUp;
   std::printf("%-32s %8.1f us   %.1f times one row read by number (%.1f us)\n", "look-up, median", median,
               median / quantile(bare, 0.5), quantile(bare, 0.5));
   std::printf("%-32s %8.1f us   ratio %.3f to 0.1 ms, below 1  %s\n", "look-up, 99 of 100", slow,
-              slow / kMostOfALookUp, within ? "ok" : "ABOVE");
+              slow / kMaxLookUp, within ? "ok" : "ABOVE");
   return within;
 }
 

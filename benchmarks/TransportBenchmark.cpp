@@ -1,14 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 //
-// What a client waits for, everything on one processor: a call to the real daemon beside a bare blocking
-// ping-pong over the same kind of socket and beside sd-bus, peer to peer; a reply with a region of all that
-// fits a datagram, through the real transport, beside a bare one of the same bytes; and the time from the
-// start of the daemon to its first answer, beside a bare server that needs the C library alone; a call to
-// a daemon that has 4,000 clients beside one that has this client alone; what the client library adds to
-// a call, and what it saves to have 1,000 calls under way at once,
-// where daemon and client have processors of their own; and the memory that the daemon has to itself after
-// its first answer, beside the bare server's.
+// What a client waits for, with everything on one processor:
+// - a call to the real daemon, beside a bare blocking ping-pong over the same kind of socket, and beside
+//   sd-bus without a bus between;
+// - a reply with the largest region that fits a datagram, beside a bare reply of the same size;
+// - the start of the daemon to its first answer, beside a bare server that needs the C library alone;
+// - a call to a daemon that has 4,000 clients, beside a call to one that has this client alone;
+// - what the client library adds to a call.
+// With a processor each for daemon and client: 1,000 calls in flight beside 1,000 calls one after another.
+// And the daemon's private memory after its first answer, beside the bare server's.
 //
 // The daemon and the bare server are programs of this build, started as a service manager starts them. The
 // daemon admits this program by an entitlement file that is written for the time being, so it wants the
@@ -56,15 +57,15 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 constexpr double kMaxRatioToBare = 1.20;
-constexpr double kMostOfBus = 0.55;
+constexpr double kMaxRatioToBus = 0.55;
 constexpr double kMaxRatioToBareRegion = 1.15;
 constexpr double kMaxRatioToBareStart = 1.35;
-constexpr double kMostOfOneClient = 1.1;  // a call of one among many, beside a call of the only one
+constexpr double kMaxRatioToOneClient = 1.1;  // a call of one among many, beside a call of the only one
 constexpr std::size_t kManyClients = 4000;
-constexpr double kMostOfLibrary = 0.15;  // of a bare ping-pong, beside a call without the library
-constexpr double kMostInFlight = 0.6;    // of as many calls one after another
+constexpr double kMaxLibraryShare = 0.15;  // of a bare ping-pong, beside a call without the library
+constexpr double kMaxRatioInFlight = 0.6;  // of as many calls one after another
 constexpr int kCallsInFlight = 1000;
-constexpr long kMostPrivateDirty = 160;  // KiB of the daemon's own after the first check-in
+constexpr long kMaxPrivateDirty = 160;  // KiB of the daemon's own after the first check-in
 
 constexpr const char kEntitlementFile[] = "/etc/brenvik/entitlements.d/50-transport-benchmark.plist";
 
@@ -378,7 +379,7 @@ bool compareCalls(const std::string& daemonPath, const std::string& barePath, in
                        {{"call of the daemon, 288 bytes in, 36 out", callOf(daemon)},
                         {"bare ping-pong, 288 bytes in, 36 out", callOf(bare)},
                         {"sd-bus peer to peer, 255 characters in", [&bus] { return bus.call(); }}},
-                       {{0, 1, kMaxRatioToBare}, {0, 2, kMostOfBus}});
+                       {{0, 1, kMaxRatioToBare}, {0, 2, kMaxRatioToBus}});
 }
 
 // A client of the library, whose calls are refused at once: their token is no text.
@@ -438,14 +439,14 @@ bool compareLibrary(const std::string& daemonPath, const std::string& barePath, 
                                   {{"call of the daemon by the library", [&] { return library.call(); }},
                                    {"the same without the library", callOf(daemon)},
                                    {"bare ping-pong", callOf(bare)}},
-                                  {{0, 2, kMostOfLibrary, 1}});
+                                  {{0, 2, kMaxLibraryShare, 1}});
   const OnAllProcessors here;
   ServedProgram beside(daemonPath);
   LibraryClient busy(beside.path());
   const bool saves = comparePaired({.rounds = rounds, .unmeasured = 1, .measured = 5},
                                    {{"1,000 calls in flight", [&] { return busy.manyInFlight(); }},
                                     {"1,000 calls one after another", [&] { return busy.manyInTurn(); }}},
-                                   {{0, 1, kMostInFlight}});
+                                   {{0, 1, kMaxRatioInFlight}});
   return adds && saves;
 }
 
@@ -470,7 +471,7 @@ bool compareManyClients(const std::string& daemonPath, int rounds) {
   return comparePaired(
       {.rounds = rounds, .unmeasured = 50, .measured = 1000},
       {{"call of one client among 4,000", callOf(many)}, {"call of the only client", callOf(one)}},
-      {{0, 1, kMostOfOneClient}});
+      {{0, 1, kMaxRatioToOneClient}});
 }
 
 bool compareRegions(const std::string& barePath, int rounds) {
@@ -512,9 +513,9 @@ bool compareMemory(const std::string& daemonPath, const std::string& barePath) {
     return program.privateDirty();
   };
   const long daemon = memoryOf(daemonPath);
-  const bool within = daemon <= kMostPrivateDirty;
+  const bool within = daemon <= kMaxPrivateDirty;
   std::printf("%-44s %6ld KiB\n%-44s %6ld KiB, at most %ld  %s\n", "private dirty memory of a bare server",
-              memoryOf(barePath), "private dirty memory of the daemon", daemon, kMostPrivateDirty,
+              memoryOf(barePath), "private dirty memory of the daemon", daemon, kMaxPrivateDirty,
               within ? "ok" : "ABOVE");
   return within;
 }
