@@ -174,7 +174,9 @@ PreparedFolder::Account accountFor(const std::string& home) {
 
 bool compareTokenReads() {
   const Folder home;
-  PreparedFolder folder([&home] { return accountFor(home.path); }, "Voicemail", stores::kVoicemailFile);
+  // Looked up once, as the helper does it.
+  const PreparedFolder::Account account = accountFor(home.path);
+  PreparedFolder folder([&account] { return account; }, "Voicemail", stores::kVoicemailFile);
   const WorkerProgram::Description description{.service = stores::kService,
                                                .program = stores::kProgram,
                                                .bootstrap = home.path,

@@ -23,6 +23,7 @@ BegunCalls::Place BegunCalls::add(bvmh_call number) {
   made.emplace_back();
   made.front().result.call = number;
   byNumber_.emplace(number, made.begin());
+  made.front().place = made.begin();
   waiting_.splice(waiting_.end(), made);
   return std::prev(waiting_.end());
 }
@@ -33,10 +34,8 @@ BegunCall* BegunCalls::find(bvmh_call number) noexcept {
 }
 
 void BegunCalls::remove(BegunCall& call) noexcept {
-  const auto found = byNumber_.find(call.result.call);
-  const Place place = found->second;
-  byNumber_.erase(found);
-  listOf(call).erase(place);
+  byNumber_.erase(call.result.call);
+  listOf(call).erase(call.place);
 }
 
 void BegunCalls::markSent(Place waiting) noexcept {
@@ -54,8 +53,7 @@ void BegunCalls::finish(BegunCall& call, std::int32_t code, int systemError) noe
   call.result.system_error = systemError;
   call.message = {};
   call.regions = {};
-  const Place place = byNumber_.find(call.result.call)->second;
-  finished_.splice(finished_.end(), listOf(call), place);
+  finished_.splice(finished_.end(), listOf(call), call.place);
   call.state = BegunCall::State::finished;
 }
 

@@ -34,6 +34,7 @@ struct BegunCall {
   std::vector<std::byte> message;
   std::array<std::vector<std::byte>, kMaxRegions> regions;
   bvmh_result result{};
+  std::list<BegunCall>::iterator place;  // in the list that it is in
 };
 
 // The begun calls of a client: those that wait to be sent, those that wait for their answer, each in their

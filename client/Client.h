@@ -127,7 +127,9 @@ class Client {
 
   // What descriptor() waits for.
   UniqueFd timer_;
+  UniqueFd results_;  // always readable; watched while results wait to be taken
   UniqueFd poll_;
+  bool watchesResults_ = false;
   std::uint64_t watched_ = 0;        // which socket; 0: none
   std::uint32_t watchedEvents_ = 0;  // and what for
   Deadline armed_ = Deadline::never();

@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <sys/epoll.h>
+#include <sys/eventfd.h>
 #include <sys/timerfd.h>
 
 #include <algorithm>
@@ -27,16 +28,21 @@ int Client::descriptor() noexcept {
   if (poll_.isValid()) return poll_.get();
   UniqueFd poll(::epoll_create1(EPOLL_CLOEXEC));
   UniqueFd timer(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
+  UniqueFd results(::eventfd(1, EFD_CLOEXEC | EFD_NONBLOCK));
   epoll_event event{};
+  epoll_event unwatched{};
   event.events = EPOLLIN;
-  if (!poll.isValid() || !timer.isValid() ||
-      ::epoll_ctl(poll.get(), EPOLL_CTL_ADD, timer.get(), &event) != 0) {
+  if (!poll.isValid() || !timer.isValid() || !results.isValid() ||
+      ::epoll_ctl(poll.get(), EPOLL_CTL_ADD, timer.get(), &event) != 0 ||
+      ::epoll_ctl(poll.get(), EPOLL_CTL_ADD, results.get(), &unwatched) != 0) {
     systemError_ = errno;
     return -1;
   }
   poll_ = std::move(poll);
   timer_ = std::move(timer);
+  results_ = std::move(results);
   watched_ = 0;
+  watchesResults_ = false;
   armed_ = Deadline::never();
   rearm();
   return poll_.get();
@@ -62,9 +68,16 @@ void Client::rearm() noexcept {
     watchedEvents_ = events;
   }
 
+  // Results that wait to be taken. A timer that is due at once would do the same at ten times the cost.
+  if (watchesResults_ == calls_.finished().empty()) {
+    watchesResults_ = !watchesResults_;
+    epoll_event event{};
+    event.events = watchesResults_ ? std::uint32_t{EPOLLIN} : 0U;
+    ::epoll_ctl(poll_.get(), EPOLL_CTL_MOD, results_.get(), &event);
+  }
+
   Deadline due = calls_.areFinished() ? Deadline::never() : earliest_;
   if (checkIn_.isUnderWay()) due = std::min(due, checkIn_.due());
-  if (!calls_.finished().empty()) due = Deadline::past();
   if (due == armed_) return;
   armed_ = due;
   itimerspec setting{};

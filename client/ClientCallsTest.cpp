@@ -5,6 +5,8 @@
 #include <pthread.h>
 #include <sys/mman.h>
 #include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/timerfd.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -19,6 +21,15 @@
 #include "client/fakes/ScriptedHelper.h"
 #include "client/include/brenvik/mobile_helper.h"
 #include "platform/base/fakes/FailingAllocations.h"
+
+namespace {
+std::atomic<int> timersSet{0};
+}  // namespace
+
+extern "C" int timerfd_settime(int fd, int flags, const itimerspec* next, itimerspec* last) noexcept {
+  ++timersSet;
+  return static_cast<int>(::syscall(SYS_timerfd_settime, fd, flags, next, last));
+}
 
 // Calls that do not block, and blocking calls that are interrupted.
 namespace brenvik::client {
@@ -192,6 +203,23 @@ TEST_F(BegunCallsTest, TheDescriptorIsReadableExactlyWhileThereIsSomethingToDo) 
   EXPECT_EQ(bvmh_take_result(client(), first, &result), BVMH_OK);
   EXPECT_FALSE(isReadable(client()));
   EXPECT_EQ(bvmh_client_fd(client()), descriptor);
+}
+
+// Setting a timer costs as much as a call where the machine is a virtual one.
+TEST_F(BegunCallsTest, TheTimerIsSetForTheFirstCallAndAfterTheLastAndNotForResults) {
+  constexpr int kCalls = 20;
+  serveConnected([](Script& script) {
+    const UniqueFd channel = script.checkIn();
+    for (int i = 0; i < kCalls; ++i) answer(script, channel, i + 1);
+    script.expectEnd(channel);
+  });
+  ASSERT_GE(bvmh_client_fd(client()), 0);
+  timersSet = 0;
+  std::vector<bvmh_call> calls;
+  for (int i = 0; i < kCalls; ++i) calls.push_back(beginClear());
+  for (int i = 0; i < kCalls; ++i) EXPECT_EQ(codeOfNext(client(), calls[static_cast<std::size_t>(i)]), i + 1);
+  EXPECT_FALSE(isReadable(client()));
+  EXPECT_EQ(timersSet, 2);
 }
 
 TEST_F(BegunCallsTest, CallsWaitForACheckInThatIsUnderWay) {

@@ -110,6 +110,9 @@ if(NOT BRENVIK_SANITIZE AND NOT BRENVIK_FUZZ AND CMAKE_BUILD_TYPE STREQUAL "Rele
     add_link_options(-Wl,-z,pack-relative-relocs)
   endif()
   add_compile_options(-ffunction-sections -fdata-sections)
+  # Nothing here asks an object for its type, and the answers would be two of the six pages that each start relocates.
+  # The sanitizers need them, so not in the other builds.
+  add_compile_options($<$<COMPILE_LANGUAGE:CXX>:-fno-rtti>)
   # Log entries name their source file. It is named from the root of the sources, wherever that is, and whether a
   # compiler cache has made the path relative to the build folder or not: what is installed is the same.
   file(RELATIVE_PATH to_sources ${PROJECT_BINARY_DIR} ${PROJECT_SOURCE_DIR})

@@ -21,6 +21,9 @@ bool look(void* library, const char* name, Function* function) noexcept {
 }
 
 bool limit(const SqliteFunctions& functions, bool* lackedMemory) noexcept {
+  // Pages one by one, as they are needed: each connection would begin with twenty, and each of them costs the
+  // first read a page fault.
+  (void)functions.config(SQLITE_CONFIG_PAGECACHE, nullptr, 0, 0);
   (void)functions.hard_heap_limit64(kMaxSqliteMemory);
   sqlite3_vfs* const files = functions.vfs_find(nullptr);
   // There is always one, unless the library could not start.

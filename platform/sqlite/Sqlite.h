@@ -18,7 +18,7 @@ struct SqliteFunctions {
 #define BRENVIK_SQLITE_FUNCTIONS(each) \
   each(bind_blob) each(bind_double) each(bind_int64) each(bind_null) each(bind_text) each(busy_handler) \
   each(changes) each(clear_bindings) each(close_v2) each(column_blob) each(column_bytes) each(column_count) \
-  each(column_double) each(column_int64) each(column_text) each(column_type) each(db_config) each(errmsg) \
+  each(column_double) each(column_int64) each(column_text) each(column_type) each(config) each(db_config) each(errmsg) \
   each(errstr) each(exec) each(extended_errcode) each(extended_result_codes) each(finalize) each(free) \
   each(get_autocommit) each(hard_heap_limit64) each(last_insert_rowid) each(limit) each(memory_highwater) each(open_v2) each(prepare_v3) \
   each(progress_handler) each(reset) each(step) each(total_changes) each(vfs_find)

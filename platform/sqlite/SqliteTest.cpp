@@ -10,6 +10,7 @@
 #include <fstream>
 #include <string>
 
+#include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/sqlite/ForeignDatabase.h"
 #include "platform/sqlite/fakes/ManualSqliteTime.h"
 
@@ -53,6 +54,19 @@ TEST(SqliteTest, EveryFunctionIsThereAndTheFirstOnesWork) {
   const SqliteStatement statement(prepared);
   ASSERT_EQ(functions->step(prepared), SQLITE_ROW);
   EXPECT_EQ(functions->column_int64(prepared, 0), 42);
+}
+
+TEST(SqliteTest, AConnectionTakesNoMorePagesThanItNeeds) {
+  const TemporaryDirectory folder;
+  sqlite3* opened = nullptr;
+  ASSERT_EQ(sqlite()->open_v2((folder / "pages.db").c_str(), &opened,
+                              SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr),
+            SQLITE_OK);
+  const SqliteDatabase database(opened);
+  const std::int64_t before = sqlite()->memory_highwater(1);
+  ASSERT_EQ(sqlite()->exec(opened, "CREATE TABLE one(id INTEGER)", nullptr, nullptr, nullptr), SQLITE_OK);
+  constexpr std::int64_t kPages = 8 * 4096;  // less than half of the twenty that it would take at once
+  EXPECT_LT(sqlite()->memory_highwater(0), before + kPages);
 }
 
 class ForeignDatabaseTest : public testing::Test {

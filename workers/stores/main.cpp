@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 // brenvik-store-worker: keeps the voicemail store and the contacts for the helper, with no more rights than
 // the account they belong to. Works in the folders that it is handed, and knows no path.
+#include <malloc.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -48,6 +49,8 @@ int main() {
   // The same identifier as the helper's: whoever reads its log sees what became of its requests.
   brenvik::SystemLog log("BrenvikMobileHelper");
   brenvik::setLogSink(&log);
+  // One heap for all threads: a heap of its own would cost the first request as much as opening its database.
+  (void)::mallopt(M_ARENA_MAX, 1);
   // Nothing it is asked goes without: the first request finds the library there.
   (void)brenvik::sqlite();
   const int status = brenvik::WorkerHost::run({.service = brenvik::stores::kService,

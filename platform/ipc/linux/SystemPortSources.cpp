@@ -17,6 +17,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/ipc/linux/BacklogGuess.h"
 #include "platform/ipc/linux/ConnectionBooks.h"
 #include "platform/ipc/linux/MessageTrailerBuilder.h"
 #include "platform/ipc/linux/RefusalLimit.h"
@@ -183,6 +184,7 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
   void ready(Readiness readiness) noexcept {
     const auto keptAlive = shared_from_this();
     if (pending_ != nullptr && !sendPending(readiness)) return;
+    backlog_.turnBegins(std::chrono::steady_clock::now);
     for (int taken = 0; taken < kMessageBudget && pending_ == nullptr && owner_ != nullptr; ++taken) {
       if (isDoor_ && !owner_->mayBeRead(*this)) {
         // Who has gone does not wait for an answer, nor keep the place of one who does.
@@ -192,14 +194,17 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
       }
       const auto received = isDoor_ ? incoming_.peek(fd_->get(), account()) : incoming_.receive(fd_->get());
       if (received == IncomingMessage::Received::endOfChannel) return end();
-      if (received == IncomingMessage::Received::nothing) break;
+      if (received == IncomingMessage::Received::nothing) {
+        backlog_.foundNothing();
+        break;
+      }
       const bool answerWanted = incoming_.hasHeader() && incoming_.header().replyPort != kNullPort;
       serve();
       if (source_ == nullptr) return;  // paused, or ended
-      // Who waits for an answer sends nothing meanwhile: looking once more would cost a system call for
-      // nothing.
-      if (answerWanted) break;
+      // A client that waits for its answer sends nothing meanwhile.
+      if (answerWanted && (isDoor_ || !backlog_.isLikely())) break;
     }
+    backlog_.turnEnds(std::chrono::steady_clock::now);
     if (owner_ != nullptr && pending_ == nullptr && readiness.isOver() && !readiness.isReadable) {
       end();  // nothing left to read, and nobody left to answer
     }
@@ -263,6 +268,7 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
   const pid_t peer_;
   RunLoop* loop_ = nullptr;
   std::unique_ptr<DescriptorSource> source_;
+  BacklogGuess backlog_;
   std::unique_ptr<OutgoingReply> pending_;
   std::unique_ptr<LoopSource> retry_;  // while the kernel has no memory for the reply
   int retriesLeft_ = 0;

@@ -29,6 +29,7 @@
 #include <vector>
 
 #include "platform/base/fakes/FailingCalls.h"
+#include "platform/ipc/linux/BacklogGuess.h"
 #include "platform/ipc/linux/MessageTrailerBuilder.h"
 #include "platform/ipc/linux/SystemBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
@@ -42,12 +43,24 @@ using namespace std::chrono_literals;
 
 std::function<void()> beforeLocking;  // what happens before a file is locked
 
+// How far the clock goes with each look at it; negative: it is the system's.
+constinit std::chrono::nanoseconds clockStep{-1};
+constinit std::chrono::nanoseconds steppedTime{};
+
 }  // namespace
 }  // namespace brenvik
 
 extern "C" int flock(int fd, int operation) noexcept {
   if (brenvik::beforeLocking != nullptr) brenvik::beforeLocking();
   return static_cast<int>(::syscall(SYS_flock, fd, operation));
+}
+
+extern "C" int clock_gettime(clockid_t clock, timespec* time) noexcept {
+  using brenvik::clockStep, brenvik::steppedTime;
+  if (clockStep.count() < 0) return static_cast<int>(::syscall(SYS_clock_gettime, clock, time));
+  steppedTime += clockStep;
+  *time = {steppedTime.count() / 1'000'000'000, steppedTime.count() % 1'000'000'000};
+  return 0;
 }
 
 extern "C" ssize_t send(int fd, const void* bytes, size_t size, int flags) {
@@ -724,6 +737,59 @@ TEST_F(PortsTest, NoMoreThanABudgetOfOneClientsMessagesIsTakenBeforeTheOthersGet
   EXPECT_TRUE(receiveFrom(otherEnd->get())) << "the other client did not wait for a hundred messages";
   pump();
   EXPECT_EQ(table.served, 101);
+}
+
+// A client that has sent many requests before it looks for answers.
+class BusyClientTest : public PortsTest {
+ protected:
+  static constexpr int kRequests = 128;
+
+  ~BusyClientTest() override { clockStep = std::chrono::nanoseconds(-1); }
+
+  // How many turns of the loop it takes to answer them.
+  int turnsForRequestsThatWait() {
+    for (int i = 0; i < kRequests; ++i) EXPECT_TRUE(sendTo(client.get(), message(kEcho)));
+    int turns = 0;
+    while (loop->run(0s, ReturnAfterSource::yes) == RunResult::handledSource) ++turns;
+    for (int i = 0; i < kRequests; ++i) EXPECT_TRUE(receiveFrom(client.get()));
+    return turns;
+  }
+};
+
+TEST_F(BusyClientTest, RequestsThatWaitCostNoTurnOfTheLoopEach) {
+  clockStep = 0ns;
+  EXPECT_LE(turnsForRequestsThatWait(), 32);
+}
+
+TEST_F(BusyClientTest, RequestsForWhichTheLoopHadToWaitCostATurnEach) {
+  clockStep = BacklogGuess::kAtOnce;
+  EXPECT_EQ(turnsForRequestsThatWait(), kRequests);
+}
+
+TEST_F(BusyClientTest, ItsRequestsCostAnotherClientNoMoreThanABudget) {
+  PortName other = kNullPort;
+  ASSERT_EQ(ports.allocateReceiveRight(&other), kern::success);
+  ASSERT_EQ(ports.insertSendRight(other), kern::success);
+  const auto second = sources.makeRoutineSource(other, table, WantTrailer::no);
+  ASSERT_TRUE(second->addTo(*loop));
+  const auto otherEnd = ports.sendEnd(other);
+  clockStep = 0ns;
+  ASSERT_LE(turnsForRequestsThatWait(), 32);
+  // One of its turns is timed, and the next takes as many as it may.
+  for (int i = 0; i < kRequests; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
+  int served = 0;
+  do {
+    served = table.served;
+    loop->run(0s, ReturnAfterSource::yes);
+  } while (table.served == served + 1);
+  ASSERT_EQ(table.served, served + 8);
+  ASSERT_TRUE(sendTo(otherEnd->get(), message(kEcho)));
+  served = table.served;
+  for (int turn = 0; turn < 2; ++turn) loop->run(0s, ReturnAfterSource::yes);
+  EXPECT_LE(table.served, served + 9);
+  EXPECT_TRUE(receiveFrom(otherEnd->get()));
+  pump();
+  EXPECT_EQ(table.served, 2 * kRequests + 1);
 }
 
 TEST_F(PortsTest, AClientThatShutsItsChannelIsReadNoMoreAndWakesNobody) {
