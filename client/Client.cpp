@@ -12,6 +12,8 @@
 #include <cerrno>
 #include <cstring>
 
+#include "platform/datagram/LocalSocket.h"
+
 namespace brenvik::client {
 namespace {
 
@@ -35,13 +37,9 @@ void Client::setTimeout(std::uint32_t milliseconds) noexcept {
 
 bool Client::setSocket(const char* path) noexcept {
   if (path == nullptr) path = bvmh_service_socket();
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  const std::size_t length = std::strlen(path);
-  if (length == 0 || length >= sizeof address.sun_path) return false;
-  std::memcpy(address.sun_path, path, length);
-  address_ = address;
-  return true;
+  const auto address = socketAddress(path);
+  if (address) address_ = *address;
+  return address.has_value();
 }
 
 std::int32_t Client::connect() noexcept {

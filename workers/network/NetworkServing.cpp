@@ -20,13 +20,13 @@
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/datagram/SealedMemory.h"
 #include "platform/network/EchoMessages.h"
 #include "platform/network/GeoMessages.h"
 #include "platform/network/GunzipMessages.h"
 #include "platform/network/NetworkWork.h"
 #include "platform/network/WebMessages.h"
 #include "platform/network/linux/LargeMessage.h"
-#include "platform/worker/linux/SealedMemory.h"
 
 namespace brenvik {
 namespace {
@@ -191,9 +191,9 @@ void NetworkServing::serveGunzip(WorkerChannel& channel) {
   const auto question = decodeGunzipQuestion(message->payload);
   if (!question) return;
   SealedMemory input;
-  const auto mapped = SealedMemory::map(message->descriptors[0].get(), question->inputSize, &input);
-  if (mapped == WorkerResult::outOfMemory) throw std::bad_alloc();
-  if (mapped != WorkerResult::done) return;
+  const int mapped = SealedMemory::map(message->descriptors[0].get(), question->inputSize, &input);
+  if (mapped == EBADMSG) return;
+  if (mapped != 0) throw std::bad_alloc();
   bool isWanted = true;
   auto told = Clock::now();
   const auto outcome = gunzip_.gunzipInto({input.bytes()}, message->descriptors[1].get(), question->room,

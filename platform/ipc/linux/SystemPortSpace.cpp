@@ -7,25 +7,12 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <array>
 #include <new>
+
+#include "platform/datagram/LocalSocket.h"
 
 namespace brenvik {
 namespace {
-
-// Whether a socket that can receive nothing any more holds no message either, so that its close drops
-// nothing.
-bool isDrained(int socket) noexcept {
-  // With credentials asked for, an empty message is told from the end of the channel.
-  const int on = 1;
-  if (::setsockopt(socket, SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0) return false;
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(ucred))> control{};
-  msghdr message{};
-  message.msg_control = control.data();
-  message.msg_controllen = control.size();
-  const ssize_t size = ::recvmsg(socket, &message, MSG_PEEK | MSG_DONTWAIT);
-  return size == 0 && message.msg_flags == 0 && message.msg_controllen == 0;
-}
 
 // Whether nothing can be put into the socket any more: its other end is gone, or either end has been shut.
 bool canReceiveNothingMore(int socket) noexcept {
@@ -87,11 +74,9 @@ void SystemPortSpace::eraseIfUnused(PortName name) noexcept {
 
 KernelReturn SystemPortSpace::allocateReceiveRight(PortName* name) noexcept {
   *name = kNullPort;
-  std::array<int, 2> ends{-1, -1};
-  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()) != 0)
-    return kern::resourceShortage;
-  UniqueFd receive(ends[0]);
-  UniqueFd peer(ends[1]);
+  UniqueFd receive;
+  UniqueFd peer;
+  if (makeSocketPair(&receive, &peer) != 0) return kern::resourceShortage;
   try {
     auto shared = share(std::move(receive), ClosingLine::kClients);
     Port* const port = insert(name);

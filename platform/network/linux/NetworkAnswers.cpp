@@ -14,7 +14,7 @@
 #include <thread>
 #include <utility>
 
-#include "platform/base/SealedMemory.h"
+#include "platform/datagram/SealedMemory.h"
 
 namespace brenvik {
 namespace {

@@ -12,8 +12,8 @@
 #include <new>
 #include <utility>
 
+#include "platform/datagram/SealedMemory.h"
 #include "platform/network/GunzipMessages.h"
-#include "platform/worker/linux/SealedMemory.h"
 
 namespace brenvik {
 namespace {
@@ -28,16 +28,7 @@ UniqueFd duplicate(int fd) noexcept { return UniqueFd(::fcntl(fd, F_DUPFD_CLOEXE
 // The input's own memory, or a copy of it that is sealed. Invalid when there is no memory for it.
 UniqueFd sealedMemoryOf(const GunzipInput& input) noexcept {
   if (input.sealedMemory >= 0) return duplicate(input.sealedMemory);
-  UniqueFd memory = makeSealableMemory("brenvik-gzip");
-  auto bytes = input.bytes;
-  while (memory.isValid() && !bytes.empty()) {
-    const auto written = ::write(memory.get(), bytes.data(), bytes.size());
-    if (written < 0 && errno == EINTR) continue;
-    if (written <= 0) return {};
-    bytes = bytes.subspan(static_cast<std::size_t>(written));
-  }
-  if (!memory.isValid() || !sealMemory(memory.get())) return {};
-  return memory;
+  return makeSealedMemory("brenvik-gzip", input.bytes);
 }
 
 }  // namespace
