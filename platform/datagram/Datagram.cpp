@@ -33,11 +33,11 @@ void takeDescriptors(const cmsghdr& item, std::span<UniqueFd> descriptors,
 
 int sendDatagram(int socket, std::span<const iovec> parts, std::span<const int> descriptors) noexcept {
   constexpr int kFlags = MSG_DONTWAIT | MSG_NOSIGNAL;
-  if (descriptors.size() > kMaxSentDescriptors) return EINVAL;
+  if (descriptors.size() > kMaxDescriptors) return EINVAL;
   msghdr message{};
   message.msg_iov = const_cast<iovec*>(parts.data());  // sendmsg only reads them
   message.msg_iovlen = parts.size();
-  alignas(cmsghdr) std::array<std::byte, CMSG_SPACE(kMaxSentDescriptors * sizeof(int))> control;
+  alignas(cmsghdr) std::array<std::byte, CMSG_SPACE(kMaxDescriptors * sizeof(int))> control;
   if (!descriptors.empty()) {
     const std::size_t room = CMSG_SPACE(descriptors.size_bytes());
     std::memset(control.data(), 0, room);

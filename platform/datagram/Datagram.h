@@ -18,8 +18,6 @@ namespace brenvik {
 
 // As many descriptors as Linux lets one datagram carry (SCM_MAX_FD).
 inline constexpr std::size_t kMaxDescriptors = 253;
-// As many as sendDatagram() takes: more than any message of ours carries.
-inline constexpr std::size_t kMaxSentDescriptors = 16;
 
 // For sending, which only reads.
 inline iovec iovecOf(std::span<const std::byte> bytes) noexcept {
@@ -28,7 +26,7 @@ inline iovec iovecOf(std::span<const std::byte> bytes) noexcept {
 
 // Sends one datagram whole or not at all, and never waits or raises SIGPIPE. The descriptors stay the
 // caller's. Returns 0 or an errno, among them: EAGAIN when the channel is full, EPIPE when the peer has
-// closed its end, ECONNRESET when it also left messages unread, EINVAL for more than kMaxSentDescriptors.
+// closed its end, ECONNRESET when it also left messages unread, EINVAL for more than kMaxDescriptors.
 int sendDatagram(int socket, std::span<const iovec> parts, std::span<const int> descriptors = {}) noexcept;
 
 // Room for what the kernel tells beside a datagram's bytes: `Descriptors` of them, the sender's credentials,

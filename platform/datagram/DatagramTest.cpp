@@ -73,7 +73,7 @@ TEST_F(DatagramTest, WhatIsCutIsToldApart) {
 // The room for control data is larger than that for descriptors, as credentials may come, too.
 TEST_F(DatagramTest, DescriptorsWithoutAPlaceAreClosed) {
   const std::size_t before = openDescriptors();
-  for (const std::size_t count : {5U, 16U}) {
+  for (const std::size_t count : {std::size_t{5}, kMaxDescriptors}) {
     ASSERT_EQ(send("x", std::vector<int>(count, ours.get())), 0);
     ASSERT_EQ(receive(), 0);
     EXPECT_EQ(received.descriptorCount, 4U) << count;
@@ -84,7 +84,7 @@ TEST_F(DatagramTest, DescriptorsWithoutAPlaceAreClosed) {
 }
 
 TEST_F(DatagramTest, NoMoreDescriptorsAreSentThanThereIsRoomFor) {
-  EXPECT_EQ(send("x", std::vector<int>(kMaxSentDescriptors + 1, ours.get())), EINVAL);
+  EXPECT_EQ(send("x", std::vector<int>(kMaxDescriptors + 1, ours.get())), EINVAL);
   EXPECT_EQ(receive(), EAGAIN);
 }
 

@@ -50,6 +50,7 @@ class Received {
       if (isDistrusted_ && each.isValid()) closeElsewhere(std::move(each));
     }
   }
+  bool isDistrusted() const noexcept { return isDistrusted_; }
   std::span<UniqueFd> descriptors() noexcept { return std::span(places).first(datagram.descriptorCount); }
 
   // For as many as one datagram can carry. So the kernel drops none in this thread, where the last close of a
@@ -79,6 +80,22 @@ WorkerResult resultOfSending(int error) noexcept {
     default:
       return WorkerResult::malformed;
   }
+}
+
+WorkerResult awaitDatagram(int socket, std::span<const iovec> pieces, Clock::time_point deadline,
+                           Received* received) noexcept {
+  ControlRoom<kMaxDescriptors> control;
+  const bool forEver = deadline == Clock::time_point::max();
+  int error = EAGAIN;
+  while (error == EAGAIN || error == EINTR) {
+    const int waited = forEver ? 0 : waitFor(socket, POLLIN, Deadline(deadline));
+    if (waited != 0) return waited == ETIMEDOUT ? WorkerResult::timedOut : WorkerResult::outOfMemory;
+    if (received->isDistrusted() && !WorkerChannel::hasRoomToDistrust()) return WorkerResult::unavailable;
+    error = receiveDatagram(socket, pieces, control.bytes, received->places, forEver ? 0 : MSG_DONTWAIT,
+                            &received->datagram);
+  }
+  if (error == 0) return WorkerResult::done;
+  return error == ENOMEM || error == ENOBUFS ? WorkerResult::outOfMemory : WorkerResult::closed;
 }
 
 }  // namespace
@@ -147,19 +164,9 @@ WorkerResult WorkerChannel::receive(WorkerMessage* message, Clock::time_point de
   std::uint32_t kind = 0;
   alignas(8) std::array<std::byte, WorkerMessage::kLongestPayload> bytes;  // written by the kernel only
   const std::array<iovec, 2> pieces{{{&kind, sizeof kind}, {bytes.data(), bytes.size()}}};
-  ControlRoom<kMaxDescriptors> control;
   Received received(isDistrusted_);
-  const bool forEver = deadline == Clock::time_point::max();
-  int error = EAGAIN;
-  while (error == EAGAIN || error == EINTR) {
-    const int waited = forEver ? 0 : waitFor(socket_.get(), POLLIN, Deadline(deadline));
-    if (waited != 0) return waited == ETIMEDOUT ? WorkerResult::timedOut : WorkerResult::outOfMemory;
-    if (isDistrusted_ && !hasRoomToDistrust()) return WorkerResult::unavailable;
-    error = receiveDatagram(socket_.get(), pieces, control.bytes, received.places, forEver ? 0 : MSG_DONTWAIT,
-                            &received.datagram);
-  }
-  if (error != 0)
-    return error == ENOMEM || error == ENOBUFS ? WorkerResult::outOfMemory : WorkerResult::closed;
+  const WorkerResult waited = awaitDatagram(socket_.get(), pieces, deadline, &received);
+  if (waited != WorkerResult::done) return waited;
   const auto& [length, count, areBytesCut, areDescriptorsCut, sender] = received.datagram;
   if (length == 0) return WorkerResult::closed;
   // There was room for all: what the kernel had to leave out found no free descriptor in this process.

@@ -54,16 +54,11 @@ PortName SystemPortSpace::unusedName() noexcept {
   return last_;
 }
 
-SystemPortSpace::Port* SystemPortSpace::insert(PortName* name) noexcept {
-  try {
-    const PortName fresh = unusedName();
-    Port& port = ports_[fresh];
-    *name = fresh;
-    return &port;
-  } catch (const std::bad_alloc&) {
-    *name = kNullPort;
-    return nullptr;
-  }
+SystemPortSpace::Port& SystemPortSpace::insert(PortName* name) {
+  const PortName fresh = unusedName();
+  Port& port = ports_[fresh];
+  *name = fresh;
+  return port;
 }
 
 void SystemPortSpace::eraseIfUnused(PortName name) noexcept {
@@ -79,11 +74,10 @@ KernelReturn SystemPortSpace::allocateReceiveRight(PortName* name) noexcept {
   if (makeSocketPair(&receive, &peer) != 0) return kern::resourceShortage;
   try {
     auto shared = share(std::move(receive), ClosingLine::kClients);
-    Port* const port = insert(name);
-    if (port == nullptr) return kern::resourceShortage;
-    port->receive = std::move(shared);
-    port->receiveReferences = 1;
-    port->peer = std::move(peer);
+    Port& port = insert(name);
+    port.receive = std::move(shared);
+    port.receiveReferences = 1;
+    port.peer = std::move(peer);
     return kern::success;
   } catch (const std::bad_alloc&) {
     return kern::resourceShortage;
@@ -143,14 +137,13 @@ PortName SystemPortSpace::adoptService(UniqueFd listening, std::string socketFil
     // Closing it drops what was sent over connections that nobody has accepted.
     auto shared = shareForeign(std::move(listening), ClosingLine::kClients);
     PortName name = kNullPort;
-    Port* const port = insert(&name);
-    if (port == nullptr) return kNullPort;
-    port->receive = std::move(shared);
-    port->receiveReferences = 1;
-    port->service = true;
+    Port& port = insert(&name);
+    port.receive = std::move(shared);
+    port.receiveReferences = 1;
+    port.service = true;
     struct stat status {};
-    if (!socketFile.empty() && ::lstat(socketFile.c_str(), &status) == 0) port->socketInode = status.st_ino;
-    port->socketFile = std::move(socketFile);
+    if (!socketFile.empty() && ::lstat(socketFile.c_str(), &status) == 0) port.socketInode = status.st_ino;
+    port.socketFile = std::move(socketFile);
     return name;
   } catch (const std::bad_alloc&) {
     return kNullPort;
@@ -161,10 +154,9 @@ PortName SystemPortSpace::adoptSendRight(UniqueFd end, Account account) noexcept
   try {
     auto shared = shareForeign(std::move(end), account);
     PortName name = kNullPort;
-    Port* const port = insert(&name);
-    if (port == nullptr) return kNullPort;
-    port->send = std::move(shared);
-    port->sendReferences = 1;
+    Port& port = insert(&name);
+    port.send = std::move(shared);
+    port.sendReferences = 1;
     return name;
   } catch (const std::bad_alloc&) {
     return kNullPort;
