@@ -10,11 +10,10 @@
 #include <list>
 #include <mutex>
 #include <new>
-#include <semaphore>
-#include <thread>
 #include <utility>
 
 #include "platform/datagram/SealedMemory.h"
+#include "platform/runloop/RunAndWait.h"
 
 namespace brenvik {
 namespace {
@@ -93,17 +92,7 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
     }
     if (queue == nullptr || !used) return;
     // Whoever waits for an answer waits until this is done, so it is, however long memory is short.
-    for (std::binary_semaphore abandoned(0);;) {
-      try {
-        queue->post([this, &abandoned] {
-          abandonAll();
-          abandoned.release();
-        });
-        return abandoned.acquire();
-      } catch (const std::bad_alloc&) {
-        std::this_thread::sleep_for(milliseconds(10));
-      }
-    }
+    runAndWait(*queue, [this] { abandonAll(); });
   }
 
  private:

@@ -14,13 +14,12 @@
 #include <mutex>
 #include <new>
 #include <optional>
-#include <semaphore>
 #include <span>
 #include <string_view>
-#include <thread>
 #include <utility>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/runloop/RunAndWait.h"
 #include "platform/web/linux/curl/ResponseHead.h"
 
 namespace brenvik {
@@ -287,17 +286,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
       return;
     }
     // Whoever waits for a transfer waits until this is done, so it is, however long memory is short.
-    for (std::binary_semaphore abandoned(0);;) {
-      try {
-        queue->post([this, &abandoned] {
-          abandonAll(WebErrorKind::cancelled);
-          abandoned.release();
-        });
-        return abandoned.acquire();
-      } catch (const std::bad_alloc&) {
-        std::this_thread::sleep_for(milliseconds(10));
-      }
-    }
+    runAndWait(*queue, [this] { abandonAll(WebErrorKind::cancelled); });
   }
 
  private:
