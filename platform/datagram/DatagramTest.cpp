@@ -125,7 +125,7 @@ TEST_F(DatagramTest, ErrorsAreToldAndLeaveNothingOfTheMessageBefore) {
   EXPECT_EQ(receive(), EBADF);
 }
 
-TEST_F(DatagramTest, APeerThatHasGoneIsNoSignal) {
+TEST_F(DatagramTest, APeerThatHasGoneIsAnErrorOfItsOwn) {
   theirs.reset();
   EXPECT_EQ(send("x"), EPIPE);
   EXPECT_EQ(send("x", {ours.get()}), EPIPE);
