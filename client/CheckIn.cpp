@@ -3,7 +3,6 @@
 #include "client/CheckIn.h"
 
 #include <fcntl.h>
-#include <sys/socket.h>
 
 #include <algorithm>
 #include <array>
@@ -12,6 +11,7 @@
 
 #include "client/Outgoing.h"
 #include "interface/Messages.h"
+#include "platform/datagram/LocalSocket.h"
 
 namespace brenvik::client {
 namespace {
@@ -102,11 +102,11 @@ std::optional<std::int32_t> CheckIn::tryEnded(std::int32_t code) noexcept {
 }
 
 std::optional<std::int32_t> CheckIn::connect() noexcept {
-  service_.reset(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  service_ = makeSocket(Blocking::no);
   if (!service_.isValid()) return systemFailure();
   ++serial_;
   int result = 0;
-  do result = ::connect(service_.get(), reinterpret_cast<const sockaddr*>(&address_), sizeof address_);
+  do result = connectSocket(service_.get(), address_);
   while (result != 0 && errno == EINTR);
   if (result == 0) return ask();
   if (errno == EAGAIN) {
@@ -122,10 +122,8 @@ std::optional<std::int32_t> CheckIn::connect() noexcept {
 }
 
 std::optional<std::int32_t> CheckIn::ask() noexcept {
-  int ends[2];
-  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0) return systemFailure();
-  channel_.deathWatch.reset(ends[0]);
-  const UniqueFd given(ends[1]);
+  UniqueFd given;
+  if (makeSocketPair(&channel_.deathWatch, &given) != 0) return systemFailure();
 
   CheckInRequest request{};
   request.header = {kComplexBit | kReplyDisposition, sizeof request, tries_, 0, 0, kCheckInRoutine.id};

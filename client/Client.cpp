@@ -12,6 +12,8 @@
 #include <cerrno>
 #include <cstring>
 
+#include "platform/datagram/LocalSocket.h"
+
 namespace brenvik::client {
 namespace {
 
@@ -35,13 +37,9 @@ void Client::setTimeout(std::uint32_t milliseconds) noexcept {
 
 bool Client::setSocket(const char* path) noexcept {
   if (path == nullptr) path = bvmh_service_socket();
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  const std::size_t length = std::strlen(path);
-  if (length == 0 || length >= sizeof address.sun_path) return false;
-  std::memcpy(address.sun_path, path, length);
-  address_ = address;
-  return true;
+  const auto address = socketAddress(path);
+  if (address) address_ = *address;
+  return address.has_value();
 }
 
 std::int32_t Client::connect() noexcept {
@@ -223,24 +221,11 @@ std::int32_t Client::call(const RoutineFacts& routine, std::span<std::byte> mess
     }
     // A check-in has used up some of the time, which the socket option does not know.
     const Waiting waiting = hasCheckedIn ? Waiting::byPoll : armSocketTimeout();
-    const PortName replyPort = nextReplyPort();
-    const MessageHeader header = headerOf(routine, replyPort);
-    std::memcpy(message.data(), &header, sizeof header);
     Reply reply;
-    waitsOnChannel_ = true;
-    Exchange outcome = interrupted_ ? Exchange::interrupted
-                                    : exchange(routine, request, replyPort, deadline, waiting, &reply);
-    waitsOnChannel_.store(false, std::memory_order_release);
-    if (outcome != Exchange::answered && interrupted_) outcome = Exchange::interrupted;
+    const Exchange outcome = exchangeAlone(routine, message, request, deadline, waiting, &reply);
     switch (outcome) {
-      case Exchange::answered: {
-        const std::int32_t code = reply.code == BVMH_OK ? readResult(routine, reply, result) : reply.code;
-        if (incoming_.descriptorCount != 0) incoming_ = Incoming{};
-        if (code == BVMH_ERROR_PROTOCOL) closeChannel();
-        if (code == BVMH_OK && Questions::isQuestion(routine.id))
-          questions_.asked(routine.id, 0, std::chrono::steady_clock::now());
-        return code;
-      }
+      case Exchange::answered:
+        return finishAlone(routine, reply, result);
       case Exchange::notTaken:
         closeChannel();
         continue;
@@ -258,6 +243,29 @@ std::int32_t Client::call(const RoutineFacts& routine, std::span<std::byte> mess
     }
     return codeOf(outcome);
   }
+}
+
+Client::Exchange Client::exchangeAlone(const RoutineFacts& routine, std::span<std::byte> message,
+                                       const Outgoing& request, Deadline deadline, Waiting waiting,
+                                       Reply* reply) noexcept {
+  const PortName replyPort = nextReplyPort();
+  const MessageHeader header = headerOf(routine, replyPort);
+  std::memcpy(message.data(), &header, sizeof header);
+  waitsOnChannel_ = true;
+  const Exchange outcome =
+      interrupted_ ? Exchange::interrupted : exchange(routine, request, replyPort, deadline, waiting, reply);
+  waitsOnChannel_.store(false, std::memory_order_release);
+  return outcome != Exchange::answered && interrupted_ ? Exchange::interrupted : outcome;
+}
+
+std::int32_t Client::finishAlone(const RoutineFacts& routine, const Reply& reply,
+                                 bvmh_result* result) noexcept {
+  const std::int32_t code = reply.code == BVMH_OK ? readResult(routine, reply, result) : reply.code;
+  if (incoming_.descriptorCount != 0) incoming_ = Incoming{};
+  if (code == BVMH_ERROR_PROTOCOL) closeChannel();
+  if (code == BVMH_OK && Questions::isQuestion(routine.id))
+    questions_.asked(routine.id, 0, std::chrono::steady_clock::now());
+  return code;
 }
 
 std::int32_t Client::callAmongBegun(const RoutineFacts& routine, std::span<const std::byte> message,

@@ -67,6 +67,11 @@ class Client {
   std::int32_t checkIn(Deadline deadline) noexcept;
   std::int32_t callAmongBegun(const RoutineFacts& routine, std::span<const std::byte> message,
                               Regions regions, bvmh_result* result) noexcept;
+  // Sends the message, whose header it completes, and waits for its reply where no begun call is under way.
+  Exchange exchangeAlone(const RoutineFacts& routine, std::span<std::byte> message, const Outgoing& request,
+                         Deadline deadline, Waiting waiting, Reply* reply) noexcept;
+  // What such a reply says, into the result. The code of the call.
+  std::int32_t finishAlone(const RoutineFacts& routine, const Reply& reply, bvmh_result* result) noexcept;
   Exchange exchange(const RoutineFacts& routine, const Outgoing& request, PortName replyPort,
                     Deadline deadline, Waiting waiting, Reply* reply) noexcept;
   Exchange awaitReply(const RoutineFacts& routine, PortName replyPort, Deadline deadline, Waiting waiting,

@@ -2,7 +2,6 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <fcntl.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -14,6 +13,9 @@
 
 #include "client/Region.h"
 #include "interface/Messages.h"
+#include "platform/datagram/Datagram.h"
+#include "platform/datagram/LocalSocket.h"
+#include "platform/datagram/SealedMemory.h"
 
 // A helper that answers begun calls with any bytes. The input is a row of datagrams, each after its length
 // (u16) and a byte: its lowest bit lets memory travel along, the next one gives the datagram the reply port
@@ -32,13 +34,10 @@ void require(bool holds) {
 struct Door {
   Door() {
     path = "/tmp/client-calls-fuzz-" + std::to_string(::getpid());
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    path.copy(address.sun_path, sizeof address.sun_path - 1);
+    const auto address = socketAddress(path);
     ::unlink(path.c_str());
-    listening = UniqueFd(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-    require(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0 &&
-            ::listen(listening.get(), 4) == 0);
+    listening = makeSocket(Blocking::no);
+    require(address && bindSocket(listening.get(), *address) == 0 && ::listen(listening.get(), 4) == 0);
   }
   ~Door() { ::unlink(path.c_str()); }
   std::string path;
@@ -46,11 +45,8 @@ struct Door {
 };
 
 void sendTo(int socket, std::span<const std::byte> bytes, int descriptor) {
-  Waiting waiting = Waiting::never;
-  const std::array parts{iovec{const_cast<std::byte*>(bytes.data()), bytes.size()}};
-  const std::array descriptors{descriptor};
-  (void)sendMessage(socket, parts, descriptor < 0 ? std::span<const int>() : descriptors, Deadline::never(),
-                    &waiting);
+  const std::array parts{iovecOf(bytes)};
+  (void)sendDatagram(socket, parts, std::span(&descriptor, descriptor < 0 ? 0 : 1));
 }
 
 // Answers the check-in as a good helper does; the helper's end of the channel.
@@ -61,16 +57,16 @@ UniqueFd admit(const Door& door) {
   require(receiveMessage(connection.get(), buffer, Deadline::never(), Waiting::never, &incoming) == Io::done);
   MessageHeader request;
   std::memcpy(&request, buffer.data(), sizeof request);
-  std::array<int, 2> ends{};
-  require(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()) == 0);
-  const UniqueFd theirs(ends[1]);
+  UniqueFd ours;
+  UniqueFd theirs;
+  require(makeSocketPair(&ours, &theirs) == 0);
   CheckInReply reply{};
   reply.header = {kComplexBit | kReplyDisposition, sizeof reply, 0, request.replyPort, 0, request.id + 100};
   reply.descriptorCount = 1;
   reply.servicePort.disposition = kDispositionCopySend;
   reply.servicePort.type = kPortDescriptorType;
   sendTo(connection.get(), std::as_bytes(std::span(&reply, 1)), theirs.get());
-  return UniqueFd(ends[0]);
+  return ours;
 }
 
 }  // namespace
@@ -102,7 +98,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     const std::uint32_t replyPort = (extras >> 2) % kCalls + 1;
     if ((extras & 2) != 0 && taken >= sizeof(MessageHeader))
       std::memcpy(datagram.data() + offsetof(MessageHeader, localPort), &replyPort, sizeof replyPort);
-    const UniqueFd memory = (extras & 1) != 0 ? makeSealedMemory(kContent) : UniqueFd();
+    const UniqueFd memory = (extras & 1) != 0 ? makeSealedMemory("fuzz", kContent) : UniqueFd();
     sendTo(channel.get(), std::span(datagram).first(taken), memory.get());
     require(bvmh_process(client) == BVMH_OK);
   }

@@ -8,6 +8,7 @@
 #include <cstdlib>
 
 #include "client/Reply.h"
+#include "platform/datagram/SealedMemory.h"
 
 // Replies of any bytes. The first byte chooses the routine, the second what comes with the datagram: low bits
 // the number of descriptors, then whether they are sealed memory or sockets, then whether the kernel cut
@@ -28,7 +29,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   for (unsigned i = 0; i < (extras & 3U); ++i) {
     incoming.descriptors[i] = (extras & 4) != 0
                                   ? UniqueFd(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0))
-                                  : makeSealedMemory(kContent);
+                                  : makeSealedMemory("fuzz", kContent);
     ++incoming.descriptorCount;
   }
   Buffer buffer;

@@ -761,6 +761,19 @@ TEST(ClientTest, AReadableFileIsNoSealedMemory) {
                loadPlist);
 }
 
+// Its mappings have another unit, so the region could not be unmapped by its size.
+TEST(ClientTest, MemoryOfHugePagesIsNoRegion) {
+  const UniqueFd huge(::memfd_create("test", MFD_CLOEXEC | MFD_ALLOW_SEALING | MFD_HUGETLB));
+  if (!huge.isValid()) GTEST_SKIP() << "no huge pages here";
+  ASSERT_EQ(::ftruncate(huge.get(), 2 << 20), 0);
+  ASSERT_EQ(::fcntl(huge.get(), F_ADD_SEALS, F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE), 0);
+  expectCaught({{"memory of huge pages",
+                 [&](Script& script, const UniqueFd& channel, const Message& request) {
+                   script.send(channel, outOfLineReply(request, 16, 0), {huge.get()});
+                 }}},
+               loadPlist);
+}
+
 TEST(ClientTest, WrongCheckInRepliesAreCaught) {
   struct CheckInLie {
     const char* name;

@@ -11,13 +11,13 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <cstdio>
-#include <cstdlib>
 #include <cstring>
 #include <utility>
 
 #include "interface/Messages.h"
 #include "interface/TelephonyMessages.h"
+#include "platform/datagram/Datagram.h"
+#include "platform/datagram/LocalSocket.h"
 
 namespace brenvik::client {
 namespace {
@@ -55,10 +55,9 @@ bool makeDirectories(const char* path) noexcept {
 
 template <class Reply>
 bool sendReply(int socket, const Reply& reply) noexcept {
-  const std::array parts{iovec{const_cast<Reply*>(&reply), sizeof reply}};  // sending only reads
-  Waiting next = Waiting::byPoll;
+  const std::array parts{iovecOf(std::as_bytes(std::span(&reply, 1)))};
   // A peer that does not read its answers does not get to hold us up.
-  return sendMessage(socket, parts, {}, Deadline::in(std::chrono::milliseconds(0)), &next) == Io::done;
+  return sendDatagram(socket, parts) == 0;
 }
 
 MessageHeader replyHeader(std::uint32_t size, PortName replyPort, std::int32_t requestId) noexcept {
@@ -66,15 +65,6 @@ MessageHeader replyHeader(std::uint32_t size, PortName replyPort, std::int32_t r
 }
 
 }  // namespace
-
-bool isServiceSocket(int descriptor) noexcept {
-  const auto option = [&](int name) {
-    int value = -1;
-    socklen_t size = sizeof value;
-    return ::getsockopt(descriptor, SOL_SOCKET, name, &value, &size) == 0 ? value : -1;
-  };
-  return option(SO_DOMAIN) == AF_UNIX && option(SO_TYPE) == SOCK_SEQPACKET && option(SO_ACCEPTCONN) == 1;
-}
 
 bool ServiceSocket::adopt(int descriptor) noexcept {
   const int flags = ::fcntl(descriptor, F_GETFL);
@@ -97,39 +87,33 @@ bool ServiceSocket::isNamed() const noexcept {
 }
 
 std::int32_t ServiceSocket::listenAt(const char* directory, const char* name) noexcept {
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  const int length = std::snprintf(address.sun_path, sizeof address.sun_path, "%s/%s", directory, name);
-  if (length < 0 || static_cast<std::size_t>(length) >= sizeof address.sun_path)
-    return BVMH_ERROR_INVALID_ARGUMENT;
+  const auto address = socketAddress(directory, name);
+  if (!address) return BVMH_ERROR_INVALID_ARGUMENT;
   if (!makeDirectories(directory)) return BVMH_ERROR_SYSTEM;
-  const auto* generic = reinterpret_cast<const sockaddr*>(&address);
+  const char* const path = address->sun_path;
 
-  UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  UniqueFd socket = makeSocket(Blocking::no);
   if (!socket.isValid()) return BVMH_ERROR_SYSTEM;
-  if (::bind(socket.get(), generic, sizeof address) != 0) {
+  if (bindSocket(socket.get(), *address) != 0) {
     if (errno != EADDRINUSE) return BVMH_ERROR_SYSTEM;
     // Somebody's file: a live owner takes the connection, a dead one's refuses it.
-    const UniqueFd probe(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+    const UniqueFd probe = makeSocket(Blocking::no);
     if (!probe.isValid()) return BVMH_ERROR_SYSTEM;
-    if (::connect(probe.get(), generic, sizeof address) == 0 || errno != ECONNREFUSED)
-      return BVMH_ERROR_NAME_IN_USE;
-    if (::unlink(address.sun_path) != 0 && errno != ENOENT) return BVMH_ERROR_SYSTEM;
-    if (::bind(socket.get(), generic, sizeof address) != 0) {
+    if (connectSocket(probe.get(), *address) == 0 || errno != ECONNREFUSED) return BVMH_ERROR_NAME_IN_USE;
+    if (::unlink(path) != 0 && errno != ENOENT) return BVMH_ERROR_SYSTEM;
+    if (bindSocket(socket.get(), *address) != 0)
       return errno == EADDRINUSE ? BVMH_ERROR_NAME_IN_USE : BVMH_ERROR_SYSTEM;
-    }
   }
   struct stat facts {};
   // Anyone may connect, whatever the umask; who may speak is decided by the credentials of the connection.
-  if (::lstat(address.sun_path, &facts) != 0 || ::chmod(address.sun_path, 0666) != 0 ||
-      ::listen(socket.get(), kBacklog) != 0) {
+  if (::lstat(path, &facts) != 0 || ::chmod(path, 0666) != 0 || ::listen(socket.get(), kBacklog) != 0) {
     const int error = errno;
-    ::unlink(address.sun_path);
+    ::unlink(path);
     errno = error;
     return BVMH_ERROR_SYSTEM;
   }
   socket_ = std::move(socket);
-  address_ = address;
+  address_ = *address;
   device_ = facts.st_dev;
   inode_ = facts.st_ino;
   return BVMH_OK;
@@ -157,7 +141,7 @@ std::int32_t Listener::watch(Service service) noexcept {
 
 std::int32_t Listener::open(int pushes, int notifications) noexcept {
   for (const int each : {pushes, notifications}) {
-    if (each != -1 && !isServiceSocket(each)) return BVMH_ERROR_INVALID_ARGUMENT;
+    if (each != -1 && !isLocalSocket(each, Listening::yes)) return BVMH_ERROR_INVALID_ARGUMENT;
   }
   if (pushes == notifications) return BVMH_ERROR_INVALID_ARGUMENT;
   std::int32_t code = prepare();
@@ -229,18 +213,14 @@ std::int32_t Listener::accept(Service service) noexcept {
     const bool isOver = errno == EAGAIN || errno == EINTR || errno == ECONNABORTED;
     return isOver ? BVMH_OK : systemFailure();
   }
-  ucred peer{};
-  socklen_t size = sizeof peer;
-  if (::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0 ||
-      (peer.uid != 0 && peer.uid != ::geteuid() && peer.uid != allowedUid_)) {
-    return BVMH_OK;
-  }
+  const auto peer = peerOf(socket.get());
+  if (!peer || (peer->uid != 0 && peer->uid != ::geteuid() && peer->uid != allowedUid_)) return BVMH_OK;
   // All places taken: the oldest connection has had its time.
   const auto place = std::min_element(
       connections_.begin(), connections_.end(), [](const Connection& a, const Connection& b) {
         return (a.socket.isValid() ? a.serial : 0) < (b.socket.isValid() ? b.serial : 0);
       });
-  *place = Connection{std::move(socket), service, ++lastSerial_, peer.uid, peer.pid};
+  *place = Connection{std::move(socket), service, ++lastSerial_, peer->uid, peer->pid};
   epoll_event event{};
   event.events = EPOLLIN;
   event.data.u64 = kFirstConnectionKey + static_cast<std::uint64_t>(place - connections_.begin());
@@ -330,7 +310,7 @@ bool Listener::readPush(const Connection& connection, bvmh_event* event, std::in
   const auto request = readAs<TelephonyPushMessage>(datagram);
   if (request.descriptorCount != 1) return refused(mig::badArguments);
   if (request.values.type != kOutOfLineDescriptorType) return refused(mig::typeError);
-  const auto place = placeOfRegion(datagram, sizeof request, request.values, incoming_);
+  const auto place = placeOfRegion(datagram, sizeof request, incoming_);
   if (!place) return refused(mig::badArguments);
   bvmh_region region{};
   const std::int32_t taken = takeRegion(*place, buffer_, incoming_, &region);

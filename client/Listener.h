@@ -12,9 +12,6 @@
 
 namespace brenvik::client {
 
-// True for a listening socket of the type that named services have.
-bool isServiceSocket(int descriptor) noexcept;
-
 // The listening socket of a named service. A socket file that it made is removed again as long as it is still
 // there.
 class ServiceSocket {
@@ -25,9 +22,9 @@ class ServiceSocket {
   ~ServiceSocket();
   // Replaces a file that nobody serves. Codes of mobile_helper.h; errno stands after BVMH_ERROR_SYSTEM.
   std::int32_t listenAt(const char* directory, const char* name) noexcept;
-  // Takes over a socket that somebody else made, whose file is theirs. Precondition: isServiceSocket(). False
-  // with errno set when it cannot be made non-blocking and close-on-exec; then the descriptor stays the
-  // caller's.
+  // Takes over a socket that somebody else made, whose file is theirs. Precondition:
+  // isLocalSocket(descriptor, Listening::yes). False with errno set when it cannot be made non-blocking and
+  // close-on-exec; then the descriptor stays the caller's.
   bool adopt(int descriptor) noexcept;
   // Gives an adopted descriptor back to whoever gave it.
   void giveBack() noexcept { (void)socket_.release(); }

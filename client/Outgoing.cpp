@@ -5,10 +5,12 @@
 #include <cstdint>
 #include <cstring>
 
+#include "platform/datagram/SealedMemory.h"
+
 namespace brenvik::client {
 namespace {
 
-constexpr std::array<std::byte, 7> kPadding{};
+constexpr std::array<std::byte, kRegionAlignment - 1> kPadding{};
 
 }  // namespace
 
@@ -22,9 +24,9 @@ bool Outgoing::lay(std::span<std::byte> message, Regions regions) noexcept {
     descriptor.type = kOutOfLineDescriptorType;
     descriptor.copy = kVirtualCopy;
     descriptor.size = static_cast<std::uint32_t>(regions[i].size());
-    const std::size_t offset = roundUpTo8(end);
+    const std::size_t offset = regionOffsetAfter(end);
     if (regions[i].size() > kLargestDatagram - offset) {
-      memories_[i] = makeSealedMemory(regions[i]);
+      memories_[i] = makeSealedMemory("brenvik-region", regions[i]);
       if (!memories_[i].isValid()) return false;
       descriptors_[descriptorCount_++] = memories_[i].get();
     } else if (!regions[i].empty()) {

@@ -9,6 +9,7 @@
 #include <span>
 
 #include "client/Region.h"
+#include "platform/datagram/Datagram.h"
 
 namespace brenvik::client {
 
@@ -36,10 +37,5 @@ class Outgoing {
   std::array<int, kMaxRegions> descriptors_{};
   std::size_t descriptorCount_ = 0;
 };
-
-// For sending, which only reads.
-inline iovec iovecOf(std::span<const std::byte> bytes) noexcept {
-  return {const_cast<std::byte*>(bytes.data()), bytes.size()};
-}
 
 }  // namespace brenvik::client

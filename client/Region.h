@@ -17,21 +17,16 @@ namespace brenvik::client {
 // Room for one message; a larger datagram arrives cut, which the kernel tells.
 inline constexpr std::size_t kBufferSize = kLargestDatagram;
 
-constexpr std::size_t roundUpTo8(std::size_t size) noexcept { return (size + 7) & ~std::size_t{7}; }
-
-// A sealed memfd that holds the bytes; invalid with errno set when the system refuses.
-UniqueFd makeSealedMemory(std::span<const std::byte> bytes) noexcept;
-
 // Where a region of an incoming message stands: in the datagram, in a descriptor, or nowhere (size 0).
 struct RegionPlace {
   std::uint32_t size = 0;
   std::size_t offset = 0;  // 0: in the message's first descriptor
 };
 
-// Checks the one out-of-line region of a message whose fixed part has bodySize bytes: its place, that nothing
-// follows it, and that as many descriptors came as it needs. Nothing when any of it is not as it should be.
+// Checks the framing of a message whose fixed part has bodySize bytes and holds one out-of-line descriptor
+// and no other: the region's place, that nothing follows it, and that as many descriptors came as it needs.
+// Nothing when any of it is not as it should be.
 std::optional<RegionPlace> placeOfRegion(std::span<const std::byte> datagram, std::size_t bodySize,
-                                         const OutOfLineDescriptor& descriptor,
                                          const Incoming& incoming) noexcept;
 
 // A receive buffer of kBufferSize bytes from malloc, or none; may change hands with a region in it.

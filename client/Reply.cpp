@@ -2,10 +2,10 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "client/Reply.h"
 
-#include <sys/socket.h>
-
 #include <cstring>
 #include <utility>
+
+#include "platform/datagram/LocalSocket.h"
 
 namespace brenvik::client {
 namespace {
@@ -17,21 +17,12 @@ Message readAs(std::span<const std::byte> datagram) noexcept {
   return message;
 }
 
-bool isChannel(int descriptor) noexcept {
-  int domain = 0;
-  int type = 0;
-  socklen_t size = sizeof domain;
-  if (::getsockopt(descriptor, SOL_SOCKET, SO_DOMAIN, &domain, &size) != 0) return false;
-  size = sizeof type;
-  return ::getsockopt(descriptor, SOL_SOCKET, SO_TYPE, &type, &size) == 0 && domain == AF_UNIX &&
-         type == SOCK_SEQPACKET;
-}
-
 bool readPort(std::span<const std::byte> datagram, Incoming* incoming, Reply* reply) noexcept {
   if (datagram.size() != sizeof(CheckInReply) || incoming->descriptorCount != 1) return false;
   const auto message = readAs<CheckInReply>(datagram);
   if (message.descriptorCount != 1 || message.servicePort.type != kPortDescriptorType ||
-      message.servicePort.disposition != kDispositionCopySend || !isChannel(incoming->descriptors[0].get())) {
+      message.servicePort.disposition != kDispositionCopySend ||
+      !isLocalSocket(incoming->descriptors[0].get())) {
     return false;
   }
   reply->port = std::move(incoming->descriptors[0]);
@@ -45,7 +36,7 @@ bool readOutOfLine(std::span<const std::byte> datagram, const Incoming& incoming
       message.payload.size != message.byteCount) {
     return false;
   }
-  const auto place = placeOfRegion(datagram, sizeof(OutOfLineReply), message.payload, incoming);
+  const auto place = placeOfRegion(datagram, sizeof(OutOfLineReply), incoming);
   if (place) reply->region = *place;
   return place.has_value();
 }

@@ -200,8 +200,8 @@ int bvmh_listener_errno(const bvmh_listener* listener) {
 
 int32_t bvmh_listener_next(bvmh_listener* listener, int timeout_ms, bvmh_event* event) {
   if (listener == nullptr || event == nullptr) return BVMH_ERROR_INVALID_ARGUMENT;
-  const auto deadline = timeout_ms < 0 ? client::Deadline::never()
-                                       : client::Deadline::in(std::chrono::milliseconds(timeout_ms));
+  const auto deadline =
+      timeout_ms < 0 ? Deadline::never() : Deadline::in(std::chrono::milliseconds(timeout_ms));
   return listener->listener.next(deadline, event);
 }
 

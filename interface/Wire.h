@@ -41,6 +41,7 @@ inline constexpr std::uint32_t kComplexBit = 0x80000000;
 inline constexpr std::uint32_t kReplyDisposition = 18;  // a reply is wanted, or this is one
 inline constexpr std::int32_t kReplyIdOffset = 100;     // a reply carries the request's id plus this
 inline constexpr std::size_t kLargestDatagram = 65536;  // one message, in-line regions included
+inline constexpr std::size_t kRegionAlignment = 8;      // an in-line region starts at a multiple of it
 inline constexpr std::uint8_t kDispositionMoveSend = 17;
 inline constexpr std::uint8_t kDispositionCopySend = 19;
 inline constexpr std::uint8_t kPortDescriptorType = 0;
@@ -91,6 +92,12 @@ static_assert(sizeof(OutOfLineDescriptor) == 16 && offsetof(OutOfLineDescriptor,
 // A complex message: the descriptor count follows the header, the descriptors follow the count.
 inline constexpr std::size_t kDescriptorCountOffset = 24;
 inline constexpr std::size_t kDescriptorsOffset = 28;
+
+// Where the next in-line region starts in a datagram that is filled up to `end`. Bytes. The first one follows
+// the message, the others follow each other.
+constexpr std::size_t regionOffsetAfter(std::size_t end) noexcept {
+  return (end + kRegionAlignment - 1) / kRegionAlignment * kRegionAlignment;
+}
 
 // What the receiving platform appends to a message, at its size rounded up to 4.
 struct [[gnu::packed]] MessageTrailer {

@@ -5,9 +5,7 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
-#include <sys/mman.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -16,6 +14,11 @@
 #include <filesystem>
 #include <stdexcept>
 #include <system_error>
+
+#include "platform/datagram/Datagram.h"
+#include "platform/datagram/Deadline.h"
+#include "platform/datagram/LocalSocket.h"
+#include "platform/datagram/SealedMemory.h"
 
 namespace brenvik::client {
 namespace {
@@ -31,19 +34,14 @@ UniqueFd checked(int descriptor, const char* what) {
 }
 
 void awaitInput(int descriptor, const char* what) {
-  pollfd entry{descriptor, POLLIN, 0};
-  int ready = 0;
-  do ready = ::poll(&entry, 1, kPatience);
-  while (ready < 0 && errno == EINTR);
-  if (ready < 1) throw std::runtime_error(std::string("nothing came: ") + what);
+  if (waitFor(descriptor, POLLIN, Deadline::in(std::chrono::milliseconds(kPatience))) != 0)
+    throw std::runtime_error(std::string("nothing came: ") + what);
 }
 
 sockaddr_un addressOf(const std::string& path) {
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  if (path.size() >= sizeof address.sun_path) throw std::length_error(path);
-  std::memcpy(address.sun_path, path.data(), path.size());
-  return address;
+  const auto address = socketAddress(path);
+  if (!address) throw std::length_error(path);
+  return *address;
 }
 
 }  // namespace
@@ -113,7 +111,7 @@ Bytes checkInReply(const Message& request) {
 }
 
 UniqueFd makeMemory(std::string_view content, int seals) {
-  UniqueFd memory = checked(::memfd_create("test", MFD_CLOEXEC | MFD_ALLOW_SEALING), "memfd_create");
+  UniqueFd memory = checked(makeSealableMemory("test").release(), "memfd_create");
   if (::write(memory.get(), content.data(), content.size()) != static_cast<ssize_t>(content.size()))
     fail("write");
   if (seals != 0 && ::fcntl(memory.get(), F_ADD_SEALS, seals) != 0) fail("F_ADD_SEALS");
@@ -128,26 +126,16 @@ UniqueFd Script::accept() {
 Message Script::receive(const UniqueFd& channel) {
   awaitInput(channel.get(), "a message");
   std::string data(70'000, '\0');
-  alignas(cmsghdr) char control[CMSG_SPACE(kMaxDescriptors * sizeof(int))];
-  iovec part{data.data(), data.size()};
-  msghdr header{};
-  header.msg_iov = &part;
-  header.msg_iovlen = 1;
-  header.msg_control = control;
-  header.msg_controllen = sizeof control;
-  const ssize_t length = ::recvmsg(channel.get(), &header, MSG_CMSG_CLOEXEC);
-  if (length < 0) fail("recvmsg");
-  if (length == 0) throw std::runtime_error("the client closed the channel");
-  data.resize(static_cast<std::size_t>(length));
-  Message message{Bytes(std::move(data)), {}};
-  for (cmsghdr* each = CMSG_FIRSTHDR(&header); each != nullptr; each = CMSG_NXTHDR(&header, each)) {
-    if (each->cmsg_level != SOL_SOCKET || each->cmsg_type != SCM_RIGHTS) continue;
-    for (std::size_t at = 0; at + sizeof(int) <= each->cmsg_len - CMSG_LEN(0); at += sizeof(int)) {
-      int number = -1;
-      std::memcpy(&number, CMSG_DATA(each) + at, sizeof number);
-      message.descriptors.emplace_back(number);
-    }
-  }
+  const iovec room{data.data(), data.size()};
+  ControlRoom<kMaxDescriptors> control;
+  std::vector<UniqueFd> descriptors(kMaxDescriptors);
+  ReceivedDatagram received;
+  errno = receiveDatagram(channel.get(), std::span(&room, 1), control.bytes, descriptors, 0, &received);
+  if (errno != 0) fail("recvmsg");
+  if (received.length == 0) throw std::runtime_error("the client closed the channel");
+  data.resize(received.length);
+  descriptors.resize(received.descriptorCount);
+  Message message{Bytes(std::move(data)), std::move(descriptors)};
   return message;
 }
 
@@ -158,22 +146,13 @@ void Script::expectEnd(const UniqueFd& channel) {
 }
 
 bool Script::send(const UniqueFd& channel, const Bytes& bytes, const std::vector<int>& descriptors) {
-  alignas(cmsghdr) char control[CMSG_SPACE(kMaxDescriptors * sizeof(int))] = {};
-  iovec part{const_cast<char*>(bytes.string().data()), bytes.size()};
-  msghdr header{};
-  header.msg_iov = &part;
-  header.msg_iovlen = 1;
-  if (!descriptors.empty()) {
-    const std::size_t size = descriptors.size() * sizeof(int);
-    header.msg_control = control;
-    header.msg_controllen = CMSG_SPACE(size);
-    cmsghdr* rights = CMSG_FIRSTHDR(&header);
-    rights->cmsg_level = SOL_SOCKET;
-    rights->cmsg_type = SCM_RIGHTS;
-    rights->cmsg_len = CMSG_LEN(size);
-    std::memcpy(CMSG_DATA(rights), descriptors.data(), size);
+  const std::array parts{iovecOf(std::as_bytes(std::span(bytes.string())))};
+  // A script may fill the channel: it waits for room as a blocking send would.
+  while ((errno = sendDatagram(channel.get(), parts, descriptors)) == EAGAIN) {
+    if (waitFor(channel.get(), POLLOUT, Deadline::in(std::chrono::milliseconds(kPatience))) != 0)
+      fail("sendmsg");
   }
-  if (::sendmsg(channel.get(), &header, MSG_NOSIGNAL) >= 0) return true;
+  if (errno == 0) return true;
   if (errno != EPIPE && errno != ECONNRESET) fail("sendmsg");
   return false;
 }
@@ -183,10 +162,9 @@ UniqueFd Script::checkIn() {
   Message request = receive(connection);
   if (request.descriptors.size() != 1) throw std::runtime_error("a check-in carries one descriptor");
   deathWatch_ = std::move(request.descriptors[0]);
-  int ends[2];
-  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends) != 0) fail("socketpair");
-  UniqueFd ours(ends[0]);
-  const UniqueFd theirs(ends[1]);
+  UniqueFd ours;
+  UniqueFd theirs;
+  if ((errno = makeSocketPair(&ours, &theirs)) != 0) fail("socketpair");
   send(connection, checkInReply(request), {theirs.get()});
   return ours;
 }
@@ -196,10 +174,8 @@ ScriptedHelper::ScriptedHelper(std::function<void(Script&)> script) {
   if (::mkdtemp(pattern.data()) == nullptr) fail("mkdtemp");
   directory_ = pattern;
   path_ = directory_ + "/socket";
-  listening_ = checked(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0), "socket");
-  const sockaddr_un address = addressOf(path_);
-  if (::bind(listening_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
-    fail("bind");
+  listening_ = checked(makeSocket(Blocking::yes).release(), "socket");
+  if (bindSocket(listening_.get(), addressOf(path_)) != 0) fail("bind");
   if (::listen(listening_.get(), 8) != 0) fail("listen");
   thread_ = std::thread([this, script = std::move(script)] {
     try {
@@ -236,10 +212,8 @@ TemporaryDirectory::~TemporaryDirectory() {
 }
 
 UniqueFd connectTo(const std::string& path) {
-  UniqueFd socket = checked(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0), "socket");
-  const sockaddr_un address = addressOf(path);
-  if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
-    fail("connect");
+  UniqueFd socket = checked(makeSocket(Blocking::yes).release(), "socket");
+  if (connectSocket(socket.get(), addressOf(path)) != 0) fail("connect");
   return socket;
 }
 

@@ -5,18 +5,19 @@
 // the input says which descriptors go along, two bits each: none, a sealed memfd, an unsealed one, a socket.
 
 #include <fcntl.h>
-#include <sys/mman.h>
-#include <sys/socket.h>
 #include <unistd.h>
 
 #include <array>
 #include <cstdlib>
 #include <cstring>
+#include <span>
 #include <vector>
 
 #include "helper/requests/RequestTable.h"
 #include "helper/requests/fakes/RecordingAreas.h"
 #include "platform/base/UniqueFd.h"
+#include "platform/datagram/Datagram.h"
+#include "platform/datagram/SealedMemory.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/runloop/linux/SystemQueues.h"
 
@@ -28,10 +29,9 @@ void require(bool condition) {
   if (!condition) std::abort();
 }
 
-UniqueFd memfd(int seals) {
-  UniqueFd fd(::memfd_create("fuzz", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+UniqueFd memory() {
+  UniqueFd fd = makeSealableMemory("fuzz");
   require(::write(fd.get(), "bplist00", 8) == 8);
-  if (seals != 0) require(::fcntl(fd.get(), F_ADD_SEALS, seals) == 0);
   return fd;
 }
 
@@ -46,10 +46,11 @@ struct Server {
   PortName port = kNullPort;
   std::shared_ptr<RoutineSource> source;
   UniqueFd client;
-  UniqueFd sealed = memfd(F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE);
-  UniqueFd unsealed = memfd(0);
+  UniqueFd sealed = memory();
+  UniqueFd unsealed = memory();
 
   Server() {
+    require(sealMemory(sealed.get()));
     areas.payload = {};  // its bytes are no region of ours
     require(ports.allocateReceiveRight(&port) == kern::success &&
             ports.insertSendRight(port) == kern::success);
@@ -82,21 +83,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         break;
     }
   }
-  iovec io{const_cast<std::uint8_t*>(data + 1), size - 1};
-  msghdr message{};
-  message.msg_iov = &io;
-  message.msg_iovlen = 1;
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(4 * sizeof(int))> control{};
-  if (!fds.empty()) {
-    message.msg_control = control.data();
-    message.msg_controllen = CMSG_SPACE(fds.size() * sizeof(int));
-    cmsghdr* const item = CMSG_FIRSTHDR(&message);
-    item->cmsg_level = SOL_SOCKET;
-    item->cmsg_type = SCM_RIGHTS;
-    item->cmsg_len = CMSG_LEN(fds.size() * sizeof(int));
-    std::memcpy(CMSG_DATA(item), fds.data(), fds.size() * sizeof(int));
-  }
-  require(::sendmsg(server.client.get(), &message, MSG_DONTWAIT) == static_cast<ssize_t>(size - 1));
+  const std::array parts{iovecOf(std::as_bytes(std::span(data + 1, size - 1)))};
+  require(sendDatagram(server.client.get(), parts, fds) == 0);
   while (server.loop->run(std::chrono::seconds(0), ReturnAfterSource::yes) == RunResult::handledSource) {
   }
 

@@ -13,7 +13,7 @@
 #include <limits>
 #include <new>
 
-#include "platform/base/SealedMemory.h"
+#include "platform/datagram/SealedMemory.h"
 
 namespace brenvik {
 namespace {
@@ -49,7 +49,7 @@ bool writeBoth(int memory, std::span<const std::byte> first, std::span<const std
 
 WebBody WebBody::forAnotherProcess() {
   WebBody body;
-  body.memory_.reset(::memfd_create("brenvik-body", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+  body.memory_ = makeSealableMemory("brenvik-body");
   if (!body.memory_.isValid()) throw std::bad_alloc();
   body.form_ = Form::forAnotherProcess;
   return body;
@@ -58,7 +58,7 @@ WebBody WebBody::forAnotherProcess() {
 UniqueFd WebBody::takeSealed() noexcept {
   WebBody body = std::move(*this);
   if (body.form_ != Form::forAnotherProcess || !writeBoth(body.memory_.get(), body.tail_, {}) ||
-      !sealAgainstChange(body.memory_.get())) {
+      !sealMemory(body.memory_.get())) {
     return {};
   }
   return std::move(body.memory_);

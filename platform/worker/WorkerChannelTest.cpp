@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "platform/base/fakes/LingeringSocket.h"
+#include "platform/datagram/Datagram.h"
 #include "platform/worker/fakes/ThreadedWorker.h"
 
 namespace brenvik {
@@ -35,24 +36,9 @@ class WorkerChannelTest : public testing::Test {
 
   // As another program could, past the rules of send().
   void sendRaw(std::size_t size, std::size_t descriptors) {
-    std::vector<char> bytes(size);
-    iovec io{bytes.data(), bytes.size()};
-    std::vector<char> control(CMSG_SPACE(descriptors * sizeof(int)));
-    msghdr out{};
-    out.msg_iov = &io;
-    out.msg_iovlen = 1;
-    if (descriptors > 0) {
-      out.msg_control = control.data();
-      out.msg_controllen = control.size();
-      cmsghdr* const item = CMSG_FIRSTHDR(&out);
-      item->cmsg_level = SOL_SOCKET;
-      item->cmsg_type = SCM_RIGHTS;
-      item->cmsg_len = CMSG_LEN(descriptors * sizeof(int));
-      const int fd = STDERR_FILENO;
-      for (std::size_t i = 0; i < descriptors; ++i)
-        std::memcpy(CMSG_DATA(item) + i * sizeof fd, &fd, sizeof fd);
-    }
-    ASSERT_EQ(::sendmsg(one.descriptor(), &out, 0), static_cast<ssize_t>(size));
+    const std::vector<std::byte> bytes(size);
+    const std::array parts{iovecOf(bytes)};
+    ASSERT_EQ(sendDatagram(one.descriptor(), parts, std::vector(descriptors, STDERR_FILENO)), 0);
   }
   static int freeDescriptor() {
     const UniqueFd next(::dup(STDERR_FILENO));
@@ -173,20 +159,9 @@ TEST_P(DistrustedChannelTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
     const int fd = sent.descriptors[0].get();
     (void)receiveNow(other);
     message.descriptors.clear();  // here, and not elsewhere and later: the next close is the last
-    char byte = 0;
-    iovec io{&byte, 1};
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof fd)] = {};
-    msghdr out{};
-    out.msg_iov = &io;
-    out.msg_iovlen = 1;
-    out.msg_control = control;
-    out.msg_controllen = sizeof control;
-    cmsghdr* const item = CMSG_FIRSTHDR(&out);
-    item->cmsg_level = SOL_SOCKET;
-    item->cmsg_type = SCM_RIGHTS;
-    item->cmsg_len = CMSG_LEN(sizeof fd);
-    std::memcpy(CMSG_DATA(item), &fd, sizeof fd);
-    ASSERT_EQ(::sendmsg(one.descriptor(), &out, 0), 1);
+    const std::byte byte{};
+    const std::array parts{iovecOf(std::span(&byte, 1))};
+    ASSERT_EQ(sendDatagram(one.descriptor(), parts, std::span(&fd, 1)), 0);
   }
   sent.descriptors[0].reset();  // the last one is on its way now
   const auto before = Clock::now();

@@ -20,13 +20,13 @@
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/datagram/SealedMemory.h"
 #include "platform/network/EchoMessages.h"
 #include "platform/network/GeoMessages.h"
 #include "platform/network/GunzipMessages.h"
 #include "platform/network/NetworkWork.h"
 #include "platform/network/WebMessages.h"
 #include "platform/network/linux/LargeMessage.h"
-#include "platform/worker/linux/SealedMemory.h"
 
 namespace brenvik {
 namespace {
@@ -91,6 +91,104 @@ class Expected {
   const UniqueFd come_{::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)};
   std::mutex mutex_;
   std::optional<Answer> answer_;
+};
+
+// The echo questions of one channel, which may have one socket open between them.
+class EchoConversation {
+ public:
+  EchoConversation(EchoNetwork& network, WorkerChannel& channel) noexcept
+      : network_(network), channel_(channel) {}
+
+  // Does what is asked, and answers where an answer is due. False for what is no question, and when nobody
+  // waits for the answer.
+  bool answer(const WorkerMessage& question) {
+    switch (static_cast<EchoMessageKind>(question.kind)) {
+      case EchoMessageKind::addressOfHost:
+        return lookUp(question, [this](const char* host) -> std::optional<std::uint32_t> {
+          const auto address = network_.addressOfHost(host);
+          return address ? std::optional(address->s_addr) : std::nullopt;
+        });
+      case EchoMessageKind::protocolByName:
+        return lookUp(question, [this](const char* protocol) -> std::optional<std::uint32_t> {
+          const auto found = network_.protocolByName(protocol);
+          return found ? std::optional(static_cast<std::uint32_t>(*found)) : std::nullopt;
+        });
+      case EchoMessageKind::indexOfInterface:
+        return lookUp(question, [this](const char* interface) -> std::optional<std::uint32_t> {
+          return network_.indexOfInterface(interface);
+        });
+      case EchoMessageKind::openSocket:
+        return openSocket(question);
+      case EchoMessageKind::setReceiveBufferSize:
+        return set(question, [this](std::uint32_t bytes) {
+          socket_->setReceiveBufferSize(static_cast<int>(std::min<std::uint32_t>(bytes, INT32_MAX)));
+        });
+      case EchoMessageKind::bindToInterface:
+        return set(question, [this](std::uint32_t index) { socket_->bindToInterface(index); });
+      case EchoMessageKind::setReceiveTimeOut:
+        return setReceiveTimeOut(question);
+      case EchoMessageKind::sendTo:
+        return sendTo(question);
+      case EchoMessageKind::receive:
+        return receive(question);
+      case EchoMessageKind::refusal:
+        break;
+    }
+    return false;
+  }
+
+ private:
+  bool reply(const WorkerMessage& question, std::vector<std::byte> payload) {
+    return channel_.send({question.kind, std::move(payload), {}}) == WorkerResult::done;
+  }
+  template <class LookUp>
+  bool lookUp(const WorkerMessage& question, LookUp numberOf) {
+    const auto name = decodeName(question.payload);
+    return name && reply(question, encodeNumber(numberOf(name->c_str())));
+  }
+  // The number in a question that needs a socket.
+  std::optional<std::uint32_t> numberIn(const WorkerMessage& question) const {
+    const auto decoded = decodeNumber(question.payload);
+    return decoded && socket_ != nullptr ? *decoded : std::nullopt;
+  }
+  template <class Set>
+  bool set(const WorkerMessage& question, Set setTo) {
+    const auto number = numberIn(question);
+    if (number) setTo(*number);
+    return number.has_value();
+  }
+  bool openSocket(const WorkerMessage& question) {
+    const auto asked = decodeSocket(question.payload);
+    if (!asked) return false;
+    socket_ = network_.openEchoSocket(asked->protocol, asked->identifier);
+    return reply(question, encode(socket_ == nullptr            ? EchoSocketForm::none
+                                  : socket_->deliversIpHeader() ? EchoSocketForm::withIpHeader
+                                                                : EchoSocketForm::withoutIpHeader));
+  }
+  bool setReceiveTimeOut(const WorkerMessage& question) {
+    const auto timeOut = numberIn(question);
+    if (!timeOut) return false;
+    const int error =
+        socket_->setReceiveTimeOut(std::chrono::microseconds(std::max<std::uint32_t>(*timeOut, 1)));
+    return reply(question, encodeNumber(static_cast<std::uint32_t>(error)));
+  }
+  bool sendTo(const WorkerMessage& question) {
+    const auto asked = decodeSend(question.payload);
+    return asked && socket_ != nullptr &&
+           reply(question, encodeTransfer(socket_->sendTo(asked->destination, asked->message), {}));
+  }
+  bool receive(const WorkerMessage& question) {
+    const auto largest = numberIn(question);
+    if (!largest || *largest > kLongestEcho) return false;
+    std::array<std::byte, kLongestEcho> buffer;
+    const auto received = socket_->receive(std::span(buffer).first(*largest));
+    const auto size = static_cast<std::size_t>(std::max<std::ptrdiff_t>(received.count, 0));
+    return reply(question, encodeTransfer(received, std::span(buffer).first(size)));
+  }
+
+  EchoNetwork& network_;
+  WorkerChannel& channel_;
+  std::unique_ptr<EchoSocket> socket_;
 };
 
 }  // namespace
@@ -191,9 +289,9 @@ void NetworkServing::serveGunzip(WorkerChannel& channel) {
   const auto question = decodeGunzipQuestion(message->payload);
   if (!question) return;
   SealedMemory input;
-  const auto mapped = SealedMemory::map(message->descriptors[0].get(), question->inputSize, &input);
-  if (mapped == WorkerResult::outOfMemory) throw std::bad_alloc();
-  if (mapped != WorkerResult::done) return;
+  const int mapped = SealedMemory::map(message->descriptors[0].get(), question->inputSize, &input);
+  if (mapped == EBADMSG) return;
+  if (mapped != 0) throw std::bad_alloc();
   bool isWanted = true;
   auto told = Clock::now();
   const auto outcome = gunzip_.gunzipInto({input.bytes()}, message->descriptors[1].get(), question->room,
@@ -241,83 +339,10 @@ void NetworkServing::servePublicAddress(WorkerChannel& channel) {
 
 // Each question is answered before the next one is read; one that is no question ends the conversation.
 void NetworkServing::serveEcho(WorkerChannel& channel) {
-  std::unique_ptr<EchoSocket> socket;
-  WorkerMessage message;
-  while (channel.receive(&message, Clock::time_point::max()) == WorkerResult::done) {
-    const auto reply = [&](std::vector<std::byte> payload) {
-      return channel.send({message.kind, std::move(payload), {}}) == WorkerResult::done;
-    };
-    const auto name = [&](auto lookUp) {
-      const auto asked = decodeName(message.payload);
-      return asked && reply(encodeNumber(lookUp(asked->c_str())));
-    };
-    // Of a question that needs a socket.
-    const auto number = [&]() -> std::optional<std::uint32_t> {
-      const auto decoded = decodeNumber(message.payload);
-      return decoded && socket != nullptr ? *decoded : std::nullopt;
-    };
-    bool goesOn = false;
-    switch (static_cast<EchoMessageKind>(message.kind)) {
-      case EchoMessageKind::addressOfHost:
-        goesOn = name([&](const char* host) -> std::optional<std::uint32_t> {
-          const auto address = parts_.echo.addressOfHost(host);
-          return address ? std::optional(address->s_addr) : std::nullopt;
-        });
-        break;
-      case EchoMessageKind::protocolByName:
-        goesOn = name([&](const char* protocol) -> std::optional<std::uint32_t> {
-          const auto found = parts_.echo.protocolByName(protocol);
-          return found ? std::optional(static_cast<std::uint32_t>(*found)) : std::nullopt;
-        });
-        break;
-      case EchoMessageKind::indexOfInterface:
-        goesOn = name([&](const char* interface) -> std::optional<std::uint32_t> {
-          return parts_.echo.indexOfInterface(interface);
-        });
-        break;
-      case EchoMessageKind::openSocket:
-        if (const auto asked = decodeSocket(message.payload)) {
-          socket = parts_.echo.openEchoSocket(asked->protocol, asked->identifier);
-          goesOn = reply(encode(socket == nullptr            ? EchoSocketForm::none
-                                : socket->deliversIpHeader() ? EchoSocketForm::withIpHeader
-                                                             : EchoSocketForm::withoutIpHeader));
-        }
-        break;
-      case EchoMessageKind::setReceiveBufferSize:
-        if (const auto bytes = number()) {
-          socket->setReceiveBufferSize(static_cast<int>(std::min<std::uint32_t>(*bytes, INT32_MAX)));
-          goesOn = true;
-        }
-        break;
-      case EchoMessageKind::bindToInterface:
-        if (const auto index = number()) {
-          socket->bindToInterface(*index);
-          goesOn = true;
-        }
-        break;
-      case EchoMessageKind::setReceiveTimeOut:
-        if (const auto timeOut = number()) {
-          const int error =
-              socket->setReceiveTimeOut(std::chrono::microseconds(std::max<std::uint32_t>(*timeOut, 1)));
-          goesOn = reply(encodeNumber(static_cast<std::uint32_t>(error)));
-        }
-        break;
-      case EchoMessageKind::sendTo:
-        if (const auto asked = decodeSend(message.payload); asked && socket != nullptr)
-          goesOn = reply(encodeTransfer(socket->sendTo(asked->destination, asked->message), {}));
-        break;
-      case EchoMessageKind::receive:
-        if (const auto largest = number(); largest && *largest <= kLongestEcho) {
-          std::array<std::byte, kLongestEcho> buffer;
-          const auto received = socket->receive(std::span(buffer).first(*largest));
-          const auto size = static_cast<std::size_t>(std::max<std::ptrdiff_t>(received.count, 0));
-          goesOn = reply(encodeTransfer(received, std::span(buffer).first(size)));
-        }
-        break;
-      case EchoMessageKind::refusal:
-        break;
-    }
-    if (!goesOn) return;
+  EchoConversation conversation(parts_.echo, channel);
+  WorkerMessage question;
+  while (channel.receive(&question, Clock::time_point::max()) == WorkerResult::done &&
+         conversation.answer(question)) {
   }
 }
 

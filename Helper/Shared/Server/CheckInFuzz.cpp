@@ -6,19 +6,20 @@
 // socket. Bit 7 of the second byte admits the caller.
 
 #include <fcntl.h>
-#include <sys/mman.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <array>
 #include <chrono>
 #include <cstdlib>
 #include <cstring>
+#include <span>
 #include <string>
 #include <vector>
 
 #include "Helper/Shared/Server/CheckInTable.h"
+#include "platform/datagram/Datagram.h"
+#include "platform/datagram/LocalSocket.h"
+#include "platform/datagram/SealedMemory.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/log/Log.h"
 #include "platform/runloop/linux/SystemQueues.h"
@@ -52,11 +53,9 @@ class AbstractBootstrap final : public Bootstrap {
     name.copy(address.sun_path + 1, sizeof address.sun_path - 2);
   }
   KernelReturn checkIn(const char*, PortName* receiveRight) noexcept override {
-    UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-    const int on = 1;
-    require(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0 &&
-            ::listen(socket.get(), 8) == 0 &&
-            ::setsockopt(socket.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on) == 0);
+    UniqueFd socket = makeSocket(Blocking::no);
+    require(bindSocket(socket.get(), address) == 0 && ::listen(socket.get(), 8) == 0 &&
+            askForCredentials(socket.get()));
     *receiveRight = ports_.adoptService(std::move(socket), "");
     return kern::success;
   }
@@ -81,13 +80,12 @@ struct Server {
                                 .loop = *loop,
                                 .hasEntitlement = [this](const char*, const AuditToken&) { return admits; }};
   std::unique_ptr<ServerContext> context;
-  UniqueFd sealed{::memfd_create("fuzz", MFD_CLOEXEC | MFD_ALLOW_SEALING)};
+  UniqueFd sealed = makeSealableMemory("fuzz");
   UniqueFd null{::open("/dev/null", O_RDONLY | O_CLOEXEC)};
 
   Server() {
     setLogSink(&log);
-    require(::ftruncate(sealed.get(), 4096) == 0 &&
-            ::fcntl(sealed.get(), F_ADD_SEALS, F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE) == 0);
+    require(::ftruncate(sealed.get(), 4096) == 0 && sealMemory(sealed.get()));
     context = CreateServer(platform, "service", routines);
     require(context != nullptr);
   }
@@ -108,33 +106,18 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   size -= 2;
   const std::size_t portsBefore = server.ports.size();
 
-  UniqueFd connection(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-  std::array<int, 2> ends{};
-  require(::connect(connection.get(), reinterpret_cast<const sockaddr*>(&server.bootstrap.address),
-                    sizeof server.bootstrap.address) == 0 &&
-          ::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()) == 0);
-  UniqueFd life(ends[0]);
-  UniqueFd given(ends[1]);
+  UniqueFd connection = makeSocket(Blocking::yes);
+  UniqueFd life;
+  UniqueFd given;
+  require(connectSocket(connection.get(), server.bootstrap.address) == 0 &&
+          makeSocketPair(&life, &given) == 0);
   std::vector<int> fds;
   for (int shift = 0; shift < 8; shift += 2) {
     const std::array kind{-1, server.sealed.get(), server.null.get(), given.get()};
     if (const int fd = kind[(kinds >> shift) & 3]; fd >= 0) fds.push_back(fd);
   }
-  iovec io{const_cast<std::uint8_t*>(data), size};
-  msghdr message{};
-  message.msg_iov = &io;
-  message.msg_iovlen = 1;
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(4 * sizeof(int))> control{};
-  if (!fds.empty()) {
-    message.msg_control = control.data();
-    message.msg_controllen = CMSG_SPACE(fds.size() * sizeof(int));
-    cmsghdr* const item = CMSG_FIRSTHDR(&message);
-    item->cmsg_level = SOL_SOCKET;
-    item->cmsg_type = SCM_RIGHTS;
-    item->cmsg_len = CMSG_LEN(fds.size() * sizeof(int));
-    std::memcpy(CMSG_DATA(item), fds.data(), fds.size() * sizeof(int));
-  }
-  require(::sendmsg(connection.get(), &message, 0) == static_cast<ssize_t>(size));
+  const std::array parts{iovecOf(std::as_bytes(std::span(data, size)))};
+  require(sendDatagram(connection.get(), parts, fds) == 0);
   given.reset();
   server.pump();
 

@@ -4,7 +4,6 @@
 
 #include <fcntl.h>
 #include <poll.h>
-#include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -14,6 +13,7 @@
 #include <cstdlib>
 #include <memory>
 
+#include "platform/base/Spawn.h"
 #include "platform/files/archive/ArchiveFrames.h"
 
 namespace brenvik {
@@ -41,38 +41,15 @@ int ReaderProcess::start(const std::string& program, int input) {
   (void)::fcntl(theirs.get(), F_SETPIPE_SZ, kPipe);  // smaller is only slower
   if (::fcntl(output_.get(), F_SETFL, O_NONBLOCK) != 0) return errno;
 
-  posix_spawn_file_actions_t actions;
-  posix_spawnattr_t attributes;
-  if (const int error = ::posix_spawn_file_actions_init(&actions); error != 0) return error;
-  if (const int error = ::posix_spawnattr_init(&attributes); error != 0) {
-    ::posix_spawn_file_actions_destroy(&actions);
-    return error;
-  }
-  sigset_t all;
-  sigset_t none;
-  ::sigfillset(&all);
-  ::sigemptyset(&none);
+  Spawn spawn;
+  spawn.give(input, STDIN_FILENO);
+  spawn.give(theirs.get(), STDOUT_FILENO);
+  spawn.giveNothing(STDERR_FILENO);
   char argument[] = "brenvik-archive-reader";
   char locale[] = "LC_ALL=C.UTF-8";
   char* const arguments[] = {argument, nullptr};
   char* const environment[] = {locale, nullptr};
-  int error = ::posix_spawn_file_actions_adddup2(&actions, input, STDIN_FILENO);
-  if (error == 0) error = ::posix_spawn_file_actions_adddup2(&actions, theirs.get(), STDOUT_FILENO);
-  if (error == 0)
-    error = ::posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
-  if (error == 0) error = ::posix_spawn_file_actions_addclosefrom_np(&actions, STDERR_FILENO + 1);
-  if (error == 0) error = ::posix_spawnattr_setsigdefault(&attributes, &all);
-  if (error == 0) error = ::posix_spawnattr_setsigmask(&attributes, &none);
-  if (error == 0) {
-    error = ::posix_spawnattr_setflags(&attributes,
-                                       static_cast<short>(POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETSIGMASK));
-  }
-  if (error == 0)
-    error = ::posix_spawn(&pid_, program.c_str(), &actions, &attributes, arguments, environment);
-  ::posix_spawnattr_destroy(&attributes);
-  ::posix_spawn_file_actions_destroy(&actions);
-  if (error != 0) pid_ = -1;
-  return error;
+  return spawn.start(program.c_str(), arguments, environment, &pid_);
 }
 
 // Waits until the reader has written something, or `patience` is over. 0 or errno.

@@ -15,6 +15,7 @@
 #include <thread>
 
 #include "platform/base/fakes/LingeringSocket.h"
+#include "platform/datagram/Datagram.h"
 #include "platform/ipc/linux/IncomingMessage.h"
 #include "platform/ipc/linux/SystemPortSpace.h"
 
@@ -36,20 +37,9 @@ bool hasHungUp(const UniqueFd& fd) {
 }
 
 bool send(const UniqueFd& socket, int descriptor, std::size_t bytes = 1) {
-  char byte = 'x';
-  iovec io{&byte, bytes};
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
-  msghdr message{};
-  message.msg_iov = &io;
-  message.msg_iovlen = 1;
-  message.msg_control = control.data();
-  message.msg_controllen = control.size();
-  cmsghdr* const item = CMSG_FIRSTHDR(&message);
-  item->cmsg_level = SOL_SOCKET;
-  item->cmsg_type = SCM_RIGHTS;
-  item->cmsg_len = CMSG_LEN(sizeof(int));
-  std::memcpy(CMSG_DATA(item), &descriptor, sizeof descriptor);
-  return ::sendmsg(socket.get(), &message, 0) == static_cast<ssize_t>(bytes);
+  const std::byte byte{'x'};
+  const std::array parts{iovecOf(std::span(&byte, bytes))};
+  return sendDatagram(socket.get(), parts, std::span(&descriptor, 1)) == 0;
 }
 
 TEST(ClosingLineTest, ClosesWhatItIsGiven) {

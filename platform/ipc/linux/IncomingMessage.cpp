@@ -8,28 +8,16 @@
 #include <cerrno>
 #include <cstring>
 
-#include "platform/base/SealedMemory.h"
-#include "platform/ipc/linux/DescriptorWalk.h"
+#include "platform/datagram/DescriptorWalk.h"
+#include "platform/datagram/LocalSocket.h"
+#include "platform/datagram/SealedMemory.h"
 
 namespace brenvik {
-namespace {
-
-bool isPortSocket(int fd) noexcept {
-  int domain = AF_UNSPEC;
-  int type = 0;
-  socklen_t size = sizeof domain;
-  // What is no socket has neither, and both stay as they are.
-  (void)::getsockopt(fd, SOL_SOCKET, SO_DOMAIN, &domain, &size);
-  (void)::getsockopt(fd, SOL_SOCKET, SO_TYPE, &type, &size);
-  return domain == AF_UNIX && type == SOCK_SEQPACKET;
-}
-
-}  // namespace
 
 IncomingMessage::~IncomingMessage() { release(false); }
 
 IncomingMessage::Received IncomingMessage::receive(int fd) noexcept {
-  return receive(fd, 0, kControlRoom, ClosingLine::kClients);
+  return receive(fd, 0, sizeof storage_.control, ClosingLine::kClients);
 }
 
 IncomingMessage::Received IncomingMessage::peek(int fd, ClosingLine::Account account) noexcept {
@@ -49,34 +37,17 @@ IncomingMessage::Received IncomingMessage::receive(int fd, int flags, std::size_
                                                    ClosingLine::Account account) noexcept {
   release(false);
   account_ = account;
-  iovec io{storage_.bytes.data(), storage_.bytes.size()};
-  msghdr message{};
-  message.msg_iov = &io;
-  message.msg_iovlen = 1;
-  message.msg_control = storage_.control.data();
-  message.msg_controllen = controlRoom;
-  const ssize_t size = ::recvmsg(fd, &message, flags | MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
-  if (size < 0) return errno == EAGAIN ? Received::nothing : Received::endOfChannel;
-
-  sender_.reset();
-  // A local socket has control data of its own level only, and room for all of it is there.
-  for (cmsghdr* item = CMSG_FIRSTHDR(&message); item != nullptr; item = CMSG_NXTHDR(&message, item)) {
-    if (item->cmsg_type == SCM_CREDENTIALS) {
-      ucred credentials{};
-      std::memcpy(&credentials, CMSG_DATA(item), sizeof credentials);
-      sender_ = credentials;
-    } else if (item->cmsg_type == SCM_RIGHTS) {
-      const std::size_t count = (item->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-      for (std::size_t i = 0; i < count; ++i) {
-        int received = -1;
-        std::memcpy(&received, CMSG_DATA(item) + i * sizeof(int), sizeof received);
-        fds_[fdCount_++].reset(received);
-      }
-    }
-  }
-  bytesCut_ = (message.msg_flags & MSG_TRUNC) != 0;
-  descriptorsCut_ = (message.msg_flags & MSG_CTRUNC) != 0;
-  length_ = static_cast<std::size_t>(size);
+  const iovec room{storage_.bytes.data(), storage_.bytes.size()};
+  ReceivedDatagram received;
+  const int error =
+      receiveDatagram(fd, std::span(&room, 1), std::span(storage_.control.bytes).first(controlRoom), fds_,
+                      flags | MSG_DONTWAIT, &received);
+  if (error != 0) return error == EAGAIN ? Received::nothing : Received::endOfChannel;
+  sender_ = received.sender;
+  fdCount_ = received.descriptorCount;
+  bytesCut_ = received.areBytesCut;
+  descriptorsCut_ = received.areDescriptorsCut;
+  length_ = received.length;
   if (length_ == 0) {
     release(false);
     return Received::endOfChannel;
@@ -122,7 +93,7 @@ KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
     std::byte* const at = storage_.bytes.data() + descriptor->offset;
     if (descriptor->kind == WalkedDescriptor::Kind::port) {
       UniqueFd& fd = fds_[nextFd++];
-      if (!isPortSocket(fd.get())) return mig::badArguments;
+      if (!isLocalSocket(fd.get())) return mig::badArguments;
       const PortName name = ports_.adoptSendRight(std::move(fd), account_);
       if (name == kNullPort) return kern::resourceShortage;
       names_[nameCount_++] = name;

@@ -2,8 +2,6 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
-#include <sys/socket.h>
-
 #include <array>
 #include <cstddef>
 #include <memory>
@@ -11,6 +9,7 @@
 
 #include "interface/Wire.h"
 #include "platform/base/UniqueFd.h"
+#include "platform/datagram/Datagram.h"
 #include "platform/ipc/linux/SystemPortSpace.h"
 
 namespace brenvik {
@@ -63,11 +62,8 @@ class IncomingMessage {
   void release(bool keepRights) noexcept;
 
  private:
-  // For SCM_MAX_FD rights, which is what the kernel lets one message carry, and its word on the sender.
-  static constexpr std::size_t kControlRoom = CMSG_SPACE(sizeof(int) * 253) + CMSG_SPACE(sizeof(ucred));
   // For one right: CMSG_SPACE would leave room for two.
   static constexpr std::size_t kControlRoomOfAStranger = CMSG_SPACE(sizeof(ucred)) + CMSG_LEN(sizeof(int));
-  static constexpr std::size_t kMaxRights = (kControlRoom - CMSG_LEN(0)) / sizeof(int);  // that fit in there
 
   struct Mapping {
     void* address;
@@ -91,15 +87,15 @@ class IncomingMessage {
   std::size_t fdCount_ = 0;
   std::size_t mappingCount_ = 0;
   std::size_t nameCount_ = 0;
-  std::array<UniqueFd, kMaxRights> fds_;
-  std::array<PortName, kMaxRights> names_;
+  std::array<UniqueFd, kMaxDatagramDescriptors> fds_;
+  std::array<PortName, kMaxDatagramDescriptors> names_;
   // The control data first: it shares the pages of the above. The mappings last: a check-in has none.
   struct Storage {
-    alignas(cmsghdr) std::array<char, kControlRoom> control;
+    ControlRoom<kMaxDatagramDescriptors> control;
     alignas(16) std::array<std::byte, kLargestDatagram> bytes;
   };
   Storage storage_;
-  std::array<Mapping, kMaxRights> mappings_;
+  std::array<Mapping, kMaxDatagramDescriptors> mappings_;
 };
 
 }  // namespace brenvik

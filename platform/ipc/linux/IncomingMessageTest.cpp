@@ -8,10 +8,10 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
-#include <cstring>
-
 #include "platform/base/fakes/FailingAllocations.h"
 #include "platform/base/fakes/FailingCalls.h"
+#include "platform/datagram/LocalSocket.h"
+#include "platform/datagram/SealedMemory.h"
 
 extern "C" void* mmap(void* at, std::size_t length, int protection, int flags, int fd,
                       off_t offset) noexcept {
@@ -26,12 +26,7 @@ using Received = IncomingMessage::Received;
 
 class IncomingMessageTest : public testing::Test {
  protected:
-  void SetUp() override {
-    std::array<int, 2> ends{};
-    ASSERT_EQ(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()), 0);
-    ours.reset(ends[0]);
-    theirs.reset(ends[1]);
-  }
+  void SetUp() override { ASSERT_EQ(makeSocketPair(&ours, &theirs), 0); }
 
   // A request with one descriptor, and the file descriptor that it speaks of.
   template <class Descriptor>
@@ -41,19 +36,8 @@ class IncomingMessageTest : public testing::Test {
       std::uint32_t count;
       Descriptor descriptor;
     } message{{kComplexBit | kReplyDisposition, sizeof message, 77, 0, 0, 1}, 1, descriptor};
-    iovec io{&message, sizeof message};
-    alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof passed)> control{};
-    msghdr raw{};
-    raw.msg_iov = &io;
-    raw.msg_iovlen = 1;
-    raw.msg_control = control.data();
-    raw.msg_controllen = control.size();
-    cmsghdr* const item = CMSG_FIRSTHDR(&raw);
-    item->cmsg_level = SOL_SOCKET;
-    item->cmsg_type = SCM_RIGHTS;
-    item->cmsg_len = CMSG_LEN(sizeof passed);
-    std::memcpy(CMSG_DATA(item), &passed, sizeof passed);
-    ASSERT_EQ(::sendmsg(theirs.get(), &raw, MSG_NOSIGNAL), static_cast<ssize_t>(sizeof message));
+    const std::array parts{iovecOf(std::as_bytes(std::span(&message, 1)))};
+    ASSERT_EQ(sendDatagram(theirs.get(), parts, std::span(&passed, 1)), 0);
   }
   static constexpr PortDescriptor kRight{0, 0, 0, kDispositionMoveSend, kPortDescriptorType};
 
@@ -81,9 +65,7 @@ TEST_F(IncomingMessageTest, ControlDataThatNobodyKnowsIsPassedOver) {
 }
 
 TEST_F(IncomingMessageTest, ARegionThatCannotBeMappedRefusesTheMessage) {
-  const UniqueFd memfd(::memfd_create("test", MFD_CLOEXEC | MFD_ALLOW_SEALING));
-  ASSERT_EQ(::write(memfd.get(), "abc", 3), 3);
-  ASSERT_EQ(::fcntl(memfd.get(), F_ADD_SEALS, F_SEAL_SHRINK | F_SEAL_GROW | F_SEAL_WRITE), 0);
+  const UniqueFd memfd = makeSealedMemory("test", std::as_bytes(std::span("abc", 3)));
   const OutOfLineDescriptor region{0, 0, 1, 0, kOutOfLineDescriptorType, 3};
   send(region, memfd.get());
   ASSERT_EQ(incoming.receive(ours.get()), Received::message);

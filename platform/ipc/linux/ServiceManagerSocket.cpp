@@ -3,7 +3,6 @@
 #include "platform/ipc/linux/ServiceManagerSocket.h"
 
 #include <fcntl.h>
-#include <sys/socket.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -15,19 +14,11 @@
 #include <system_error>
 #include <utility>
 
+#include "platform/datagram/LocalSocket.h"
 #include "platform/log/Log.h"
 
 namespace brenvik {
 namespace {
-
-bool isListeningPort(int fd) noexcept {
-  const auto has = [fd](int option, int wanted) {
-    int value = -1;
-    socklen_t size = sizeof value;
-    return ::getsockopt(fd, SOL_SOCKET, option, &value, &size) == 0 && value == wanted;
-  };
-  return has(SO_DOMAIN, AF_UNIX) && has(SO_TYPE, SOCK_SEQPACKET) && has(SO_ACCEPTCONN, 1);
-}
 
 // sd_listen_fds(3) tells how a service manager hands over sockets: descriptors from 3 on, for the process
 // that LISTEN_PID names, as many as LISTEN_FDS says, with names between colons in LISTEN_FDNAMES. The
@@ -73,7 +64,7 @@ UniqueFd takeServiceManagerSocket(const char* serviceName) {
     names.remove_prefix(std::min(name.size() + 1, names.size()));
     if (name != serviceName || chosen.isValid()) {
       logUnified(LogLevel::error, "passed over a listening descriptor named \"%s\"", name.c_str());
-    } else if (!isListeningPort(descriptor.get())) {
+    } else if (!isLocalSocket(descriptor.get(), Listening::yes)) {
       logUnified(LogLevel::error, "the descriptor named \"%s\" is no listening SOCK_SEQPACKET socket",
                  serviceName);
     } else {

@@ -4,7 +4,6 @@
 
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -13,6 +12,7 @@
 #include <utility>
 
 #include "interface/status/Status.h"
+#include "platform/datagram/LocalSocket.h"
 #include "platform/log/Log.h"
 
 namespace brenvik {
@@ -46,13 +46,11 @@ StatusSocket::StatusSocket(SystemPortSpace& ports, RunLoop& loop, std::string pa
 
 // errno says what failed.
 bool StatusSocket::listen(const std::string& servicePath) {
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  if (path_.size() >= sizeof address.sun_path) {
+  const auto address = socketAddress(path_);
+  if (!address) {
     errno = ENAMETOOLONG;
     return false;
   }
-  std::memcpy(address.sun_path, path_.c_str(), path_.size() + 1);
   struct stat facts {};
   if (::lstat(path_.c_str(), &facts) == 0) {
     if (!S_ISSOCK(facts.st_mode)) {
@@ -62,9 +60,8 @@ bool StatusSocket::listen(const std::string& servicePath) {
     // Of a helper that was killed: another one that lives would hold the service socket.
     if (::unlink(path_.c_str()) != 0) return false;
   }
-  UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-  if (!socket.isValid()) return false;
-  if (::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) return false;
+  UniqueFd socket = makeSocket(Blocking::no);
+  if (!socket.isValid() || bindSocket(socket.get(), *address) != 0) return false;
   if (::lstat(path_.c_str(), &facts) == 0) inode_ = facts.st_ino;
   // Closing it drops what was sent over connections that nobody has accepted.
   listening_ = ports_.shareForeign(std::move(socket), ClosingLine::kClients);
@@ -111,9 +108,7 @@ bool StatusSocket::acceptOne() {
 
 // False when the account has asked too often.
 bool StatusSocket::tell(UniqueFd connection) {
-  ucred peer{};
-  socklen_t size = sizeof peer;
-  (void)::getsockopt(connection.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size);
+  const ucred peer = peerOf(connection.get()).value_or(ucred{});
   // From here on what the peer may have sent is closed where nobody waits for it.
   const auto shared = ports_.share(std::move(connection), peer.uid);
   if (!limit_.allows(peer.uid, now_())) return false;

@@ -19,6 +19,7 @@
 #include <vector>
 
 #include "platform/base/fakes/LingeringSocket.h"
+#include "platform/datagram/Datagram.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
 
@@ -205,21 +206,10 @@ TEST_F(StatusSocketTest, WhatAPeerSentIsNotReadAndStaysNowhere) {
   const std::size_t before = descriptors();
   UniqueFd end = connect();
   const UniqueFd carried(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-  char byte = 'x';
-  iovec io{&byte, 1};
-  msghdr message{};
-  message.msg_iov = &io;
-  message.msg_iovlen = 1;
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
-  message.msg_control = control.data();
-  message.msg_controllen = control.size();
-  cmsghdr* const item = CMSG_FIRSTHDR(&message);
-  item->cmsg_level = SOL_SOCKET;
-  item->cmsg_type = SCM_RIGHTS;
-  item->cmsg_len = CMSG_LEN(sizeof(int));
-  const int fd = carried.get();
-  std::memcpy(CMSG_DATA(item), &fd, sizeof fd);
-  ASSERT_EQ(::sendmsg(end.get(), &message, MSG_NOSIGNAL), 1);
+  const std::byte byte{'x'};
+  const std::array parts{iovecOf(std::span(&byte, 1))};
+  const std::array passed{carried.get()};
+  ASSERT_EQ(sendDatagram(end.get(), parts, passed), 0);
   serve();
   ports.closing().drain();
   EXPECT_EQ(descriptors(), before + 2) << "the test's own two";

@@ -8,7 +8,6 @@
 #include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -20,6 +19,7 @@
 #include <thread>
 #include <vector>
 
+#include "platform/datagram/LocalSocket.h"
 #include "platform/ipc/linux/ServiceManagerSocket.h"
 #include "platform/log/Log.h"
 
@@ -34,8 +34,8 @@ constexpr std::chrono::milliseconds kLockPause{10};
 // Whether somebody listens behind a socket file. Only a refusal says no: a full backlog, another kind of
 // socket and a probe that cannot be made at all leave the file where it is.
 bool isAlive(const sockaddr_un& address) noexcept {
-  const UniqueFd probe(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-  if (::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0) return true;
+  const UniqueFd probe = makeSocket(Blocking::no);
+  if (connectSocket(probe.get(), address) == 0) return true;
   return errno != ECONNREFUSED && errno != ENOENT;
 }
 
@@ -85,13 +85,11 @@ bool SystemBootstrap::openToGroup(const std::string& path) const {
 }
 
 UniqueFd SystemBootstrap::listenAt(const std::string& path, const char* serviceName) {
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  if (path.size() >= sizeof address.sun_path) {
+  const auto address = socketAddress(path);
+  if (!address) {
     logUnified(LogLevel::error, "%s: the path is too long for a socket", path.c_str());
     return {};
   }
-  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
 
   std::error_code error;
   std::filesystem::create_directories(directory_, error);
@@ -108,17 +106,16 @@ UniqueFd SystemBootstrap::listenAt(const std::string& path, const char* serviceN
       logUnified(LogLevel::error, "%s is not a socket, and stays as it is", path.c_str());
       return {};
     }
-    if (isAlive(address)) {
+    if (isAlive(*address)) {
       logUnified(LogLevel::error, "another process already serves %s", path.c_str());
       return {};
     }
     ::unlink(path.c_str());
   }
 
-  UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-  if (!socket.isValid() ||
-      ::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
-      !openToGroup(path) || ::listen(socket.get(), SOMAXCONN) != 0) {
+  UniqueFd socket = makeSocket(Blocking::yes);
+  if (!socket.isValid() || bindSocket(socket.get(), *address) != 0 || !openToGroup(path) ||
+      ::listen(socket.get(), SOMAXCONN) != 0) {
     logUnified(LogLevel::error, "cannot listen at %s: %s", path.c_str(), std::strerror(errno));
     return {};
   }
@@ -136,8 +133,8 @@ KernelReturn SystemBootstrap::checkIn(const char* serviceName, PortName* receive
     }
     if (!socket.isValid()) return kern::noAccess;
     // Before the first accept: a message that is already there would otherwise come without credentials.
+    if (!askForCredentials(socket.get())) return kern::failure;
     const int on = 1;
-    if (::setsockopt(socket.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0) return kern::failure;
     if (::ioctl(socket.get(), FIONBIO, &on) != 0) return kern::failure;
     *receiveRight = ports_.adoptService(std::move(socket), std::move(path));
     return *receiveRight == kNullPort ? kern::resourceShortage : kern::success;

@@ -17,6 +17,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/datagram/LocalSocket.h"
 #include "platform/ipc/linux/BacklogGuess.h"
 #include "platform/ipc/linux/ConnectionBooks.h"
 #include "platform/ipc/linux/MessageTrailerBuilder.h"
@@ -58,43 +59,29 @@ struct OutgoingReply {
 
 enum class Sent { done, channelFull, noMemory, failed };
 
-ssize_t sendOnce(int fd, OutgoingReply& reply) noexcept {
-  constexpr int kFlags = MSG_DONTWAIT | MSG_NOSIGNAL;
-  const int passed =
-      reply.memfd.isValid() ? reply.memfd.get() : (reply.right != nullptr ? reply.right->get() : -1);
-  if (passed < 0) {
-    if (reply.region == nullptr) return ::send(fd, reply.bytes.data(), reply.size, kFlags);
+Sent sendReply(int fd, OutgoingReply& reply) noexcept {
+  iovec datagram{reply.bytes.data(), reply.size};
+  if (reply.region != nullptr) {
     // One piece: a second costs the kernel as much as the rest of the call.
     static_assert(sizeof(OutOfLineReply) == SystemRegions::kRoomForMessage);
-    auto* const datagram = static_cast<std::byte*>(reply.region) - SystemRegions::kRoomForMessage;
-    std::memcpy(datagram, reply.bytes.data(), SystemRegions::kRoomForMessage);
-    return ::send(fd, datagram, SystemRegions::kRoomForMessage + reply.regionLength, kFlags);
+    datagram.iov_base = static_cast<std::byte*>(reply.region) - SystemRegions::kRoomForMessage;
+    datagram.iov_len = SystemRegions::kRoomForMessage + reply.regionLength;
+    std::memcpy(datagram.iov_base, reply.bytes.data(), SystemRegions::kRoomForMessage);
   }
-  iovec io{reply.bytes.data(), reply.size};
-  msghdr message{};
-  message.msg_iov = &io;
-  message.msg_iovlen = 1;
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
-  message.msg_control = control.data();
-  message.msg_controllen = control.size();
-  cmsghdr* const item = CMSG_FIRSTHDR(&message);
-  item->cmsg_level = SOL_SOCKET;
-  item->cmsg_type = SCM_RIGHTS;
-  item->cmsg_len = CMSG_LEN(sizeof(int));
-  std::memcpy(CMSG_DATA(item), &passed, sizeof passed);
-  return ::sendmsg(fd, &message, kFlags);
-}
-
-Sent sendReply(int fd, OutgoingReply& reply) noexcept {
-  ssize_t sent = 0;
-  do {
-    sent = sendOnce(fd, reply);
-  } while (sent < 0 && errno == EINTR);
-  if (sent >= 0) return Sent::done;
-  if (errno == EAGAIN || errno == EWOULDBLOCK) return Sent::channelFull;
-  // Not a full channel: that one becomes writable when there is room, this one says it is all the time.
-  if (errno == ENOBUFS || errno == ENOMEM) return Sent::noMemory;
-  return Sent::failed;  // ETOOMANYREFS: too many descriptors on their way already
+  const int passed = reply.right != nullptr ? reply.right->get() : reply.memfd.get();
+  const std::span<const int> descriptors(&passed, passed < 0 ? 0 : 1);
+  switch (sendDatagram(fd, std::span(&datagram, 1), descriptors)) {
+    case 0:
+      return Sent::done;
+    case EAGAIN:
+      return Sent::channelFull;
+    // Not a full channel: that one becomes writable when there is room, this one says it is all the time.
+    case ENOBUFS:
+    case ENOMEM:
+      return Sent::noMemory;
+    default:  // ETOOMANYREFS: too many descriptors on their way already
+      return Sent::failed;
+  }
 }
 
 class Channel;
@@ -609,13 +596,8 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   void serve(UniqueFd connection) {
     // A connection made before the listening socket asked for credentials (a client that started this
     // process) has not taken that over on every kernel.
-    const int on = 1;
-    if (trailer_ == WantTrailer::yes) {
-      (void)::setsockopt(connection.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on);
-    }
-    ucred peer{};
-    socklen_t size = sizeof peer;
-    (void)::getsockopt(connection.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size);
+    if (trailer_ == WantTrailer::yes) (void)askForCredentials(connection.get());
+    const ucred peer = peerOf(connection.get()).value_or(ucred{});
     const auto channel =
         std::make_shared<Channel>(static_cast<ChannelOwner&>(*this), IsDoor::yes, ports_, regions_, incoming_,
                                   ports_.share(std::move(connection), peer.uid), peer.uid, peer.pid);

@@ -7,25 +7,12 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <array>
 #include <new>
+
+#include "platform/datagram/LocalSocket.h"
 
 namespace brenvik {
 namespace {
-
-// Whether a socket that can receive nothing any more holds no message either, so that its close drops
-// nothing.
-bool isDrained(int socket) noexcept {
-  // With credentials asked for, an empty message is told from the end of the channel.
-  const int on = 1;
-  if (::setsockopt(socket, SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0) return false;
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(ucred))> control{};
-  msghdr message{};
-  message.msg_control = control.data();
-  message.msg_controllen = control.size();
-  const ssize_t size = ::recvmsg(socket, &message, MSG_PEEK | MSG_DONTWAIT);
-  return size == 0 && message.msg_flags == 0 && message.msg_controllen == 0;
-}
 
 // Whether nothing can be put into the socket any more: its other end is gone, or either end has been shut.
 bool canReceiveNothingMore(int socket) noexcept {
@@ -67,16 +54,11 @@ PortName SystemPortSpace::unusedName() noexcept {
   return last_;
 }
 
-SystemPortSpace::Port* SystemPortSpace::insert(PortName* name) noexcept {
-  try {
-    const PortName fresh = unusedName();
-    Port& port = ports_[fresh];
-    *name = fresh;
-    return &port;
-  } catch (const std::bad_alloc&) {
-    *name = kNullPort;
-    return nullptr;
-  }
+SystemPortSpace::Port& SystemPortSpace::insert(PortName* name) {
+  const PortName fresh = unusedName();
+  Port& port = ports_[fresh];
+  *name = fresh;
+  return port;
 }
 
 void SystemPortSpace::eraseIfUnused(PortName name) noexcept {
@@ -87,18 +69,15 @@ void SystemPortSpace::eraseIfUnused(PortName name) noexcept {
 
 KernelReturn SystemPortSpace::allocateReceiveRight(PortName* name) noexcept {
   *name = kNullPort;
-  std::array<int, 2> ends{-1, -1};
-  if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends.data()) != 0)
-    return kern::resourceShortage;
-  UniqueFd receive(ends[0]);
-  UniqueFd peer(ends[1]);
+  UniqueFd receive;
+  UniqueFd peer;
+  if (makeSocketPair(&receive, &peer) != 0) return kern::resourceShortage;
   try {
     auto shared = share(std::move(receive), ClosingLine::kClients);
-    Port* const port = insert(name);
-    if (port == nullptr) return kern::resourceShortage;
-    port->receive = std::move(shared);
-    port->receiveReferences = 1;
-    port->peer = std::move(peer);
+    Port& port = insert(name);
+    port.receive = std::move(shared);
+    port.receiveReferences = 1;
+    port.peer = std::move(peer);
     return kern::success;
   } catch (const std::bad_alloc&) {
     return kern::resourceShortage;
@@ -158,14 +137,13 @@ PortName SystemPortSpace::adoptService(UniqueFd listening, std::string socketFil
     // Closing it drops what was sent over connections that nobody has accepted.
     auto shared = shareForeign(std::move(listening), ClosingLine::kClients);
     PortName name = kNullPort;
-    Port* const port = insert(&name);
-    if (port == nullptr) return kNullPort;
-    port->receive = std::move(shared);
-    port->receiveReferences = 1;
-    port->service = true;
+    Port& port = insert(&name);
+    port.receive = std::move(shared);
+    port.receiveReferences = 1;
+    port.service = true;
     struct stat status {};
-    if (!socketFile.empty() && ::lstat(socketFile.c_str(), &status) == 0) port->socketInode = status.st_ino;
-    port->socketFile = std::move(socketFile);
+    if (!socketFile.empty() && ::lstat(socketFile.c_str(), &status) == 0) port.socketInode = status.st_ino;
+    port.socketFile = std::move(socketFile);
     return name;
   } catch (const std::bad_alloc&) {
     return kNullPort;
@@ -176,10 +154,9 @@ PortName SystemPortSpace::adoptSendRight(UniqueFd end, Account account) noexcept
   try {
     auto shared = shareForeign(std::move(end), account);
     PortName name = kNullPort;
-    Port* const port = insert(&name);
-    if (port == nullptr) return kNullPort;
-    port->send = std::move(shared);
-    port->sendReferences = 1;
+    Port& port = insert(&name);
+    port.send = std::move(shared);
+    port.sendReferences = 1;
     return name;
   } catch (const std::bad_alloc&) {
     return kNullPort;

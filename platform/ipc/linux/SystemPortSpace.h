@@ -63,7 +63,8 @@ class SystemPortSpace final : public PortSpace {
   };
 
   PortName unusedName() noexcept;
-  Port* insert(PortName* name) noexcept;
+  // A new port, and its name. Throws std::bad_alloc; then *name stays as it is.
+  Port& insert(PortName* name);
   std::weak_ptr<ClosingLine> weakLine() const noexcept { return closing_; }
   void eraseIfUnused(PortName name) noexcept;
 

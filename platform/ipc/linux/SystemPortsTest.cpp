@@ -29,6 +29,7 @@
 #include <vector>
 
 #include "platform/base/fakes/FailingCalls.h"
+#include "platform/datagram/Datagram.h"
 #include "platform/ipc/linux/BacklogGuess.h"
 #include "platform/ipc/linux/MessageTrailerBuilder.h"
 #include "platform/ipc/linux/SystemBootstrap.h"
@@ -215,21 +216,8 @@ class PortsTest : public testing::Test {
   }
 
   static bool sendTo(int fd, const Datagram& datagram) {
-    iovec io{const_cast<std::byte*>(datagram.bytes.data()), datagram.bytes.size()};
-    msghdr raw{};
-    raw.msg_iov = &io;
-    raw.msg_iovlen = 1;
-    std::vector<char> control(CMSG_SPACE(sizeof(int) * datagram.fds.size()));
-    if (!datagram.fds.empty()) {
-      raw.msg_control = control.data();
-      raw.msg_controllen = control.size();
-      cmsghdr* const item = CMSG_FIRSTHDR(&raw);
-      item->cmsg_level = SOL_SOCKET;
-      item->cmsg_type = SCM_RIGHTS;
-      item->cmsg_len = CMSG_LEN(sizeof(int) * datagram.fds.size());
-      std::memcpy(CMSG_DATA(item), datagram.fds.data(), sizeof(int) * datagram.fds.size());
-    }
-    return ::sendmsg(fd, &raw, MSG_NOSIGNAL | MSG_DONTWAIT) == static_cast<ssize_t>(datagram.bytes.size());
+    const std::array parts{iovecOf(datagram.bytes)};
+    return sendDatagram(fd, parts, datagram.fds) == 0;
   }
   // Serves what is ready, and no more.
   void pump() {
@@ -248,21 +236,16 @@ class PortsTest : public testing::Test {
   static std::optional<Answer> receiveFrom(int fd) {
     Answer answer;
     answer.bytes.resize(kLargestDatagram);
-    iovec io{answer.bytes.data(), answer.bytes.size()};
-    std::array<char, 256> control{};
-    msghdr raw{};
-    raw.msg_iov = &io;
-    raw.msg_iovlen = 1;
-    raw.msg_control = control.data();
-    raw.msg_controllen = control.size();
-    const ssize_t size = ::recvmsg(fd, &raw, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
-    if (size <= 0) return std::nullopt;
-    answer.bytes.resize(static_cast<std::size_t>(size));
-    for (cmsghdr* item = CMSG_FIRSTHDR(&raw); item != nullptr; item = CMSG_NXTHDR(&raw, item)) {
-      int received = -1;
-      std::memcpy(&received, CMSG_DATA(item), sizeof received);
-      answer.fds.emplace_back(received);
+    answer.fds.resize(4);
+    const iovec room{answer.bytes.data(), answer.bytes.size()};
+    ControlRoom<4> control;
+    ReceivedDatagram received;
+    if (receiveDatagram(fd, std::span(&room, 1), control.bytes, answer.fds, MSG_DONTWAIT, &received) != 0 ||
+        received.length == 0) {
+      return std::nullopt;
     }
+    answer.bytes.resize(received.length);
+    answer.fds.resize(received.descriptorCount);
     return answer;
   }
   std::optional<Answer> exchange(const Datagram& datagram) {
@@ -687,7 +670,7 @@ TEST_F(PortsTest, AFullChannelDelaysItsOwnRepliesOnlyAndIsNotReadUntilTheyHaveGo
 
 TEST_F(PortsTest, AReplyForWhichTheKernelHasNoMemoryGoesOutLaterAndNobodySpinsMeanwhile) {
   for (const int error : {ENOBUFS, ENOMEM}) {
-    const FailingCall noMemory("send", error, 0, FailingCall::HowOften::once);
+    const FailingCall noMemory("send", error, 1, FailingCall::HowOften::once);  // after the request
     EXPECT_FALSE(exchange(message(kEcho)));
     EXPECT_EQ(noMemory.failures(), 1);
     EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::timedOut)
@@ -702,7 +685,7 @@ TEST_F(PortsTest, AReplyForWhichTheKernelHasNoMemoryGoesOutLaterAndNobodySpinsMe
 
 TEST_F(PortsTest, AReplyForWhichTheKernelNeverHasMemoryEndsItsChannelAfterASecond) {
   ASSERT_EQ(ports.deallocateSendRight(port), kern::success);  // the client's copy is the only one
-  const FailingCall noMemory("send", ENOMEM, 0, FailingCall::HowOften::always);
+  const FailingCall noMemory("send", ENOMEM, 1, FailingCall::HowOften::always);  // after the request
   EXPECT_FALSE(exchange(message(kRegion).add(kNdrRecord).add(100U)));
   EXPECT_EQ(regions.live(), 1U);
   while (regions.live() > 0) ASSERT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);

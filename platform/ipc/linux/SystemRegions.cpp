@@ -10,7 +10,7 @@
 #include <cstdlib>
 #include <new>
 
-#include "platform/base/SealedMemory.h"
+#include "platform/datagram/SealedMemory.h"
 
 namespace brenvik {
 
@@ -34,7 +34,7 @@ KernelReturn SystemRegions::allocate(void** address, std::size_t length) noexcep
     *address = datagram + kRoomForMessage;
     return kern::success;
   }
-  UniqueFd memfd(::memfd_create("brenvik-reply", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+  UniqueFd memfd = makeSealableMemory("brenvik-reply");
   if (!memfd.isValid()) return kern::resourceShortage;
   // Allocated, not only sized: memory that is not there fails here and not as a SIGBUS while it is written.
   if (::posix_fallocate(memfd.get(), 0, static_cast<off_t>(length)) != 0) return kern::noSpace;
@@ -69,7 +69,7 @@ UniqueFd SystemRegions::sealIntoDescriptor(void* address, std::size_t length) no
   large_.erase(region);
   // The seal against writing is refused while a writable mapping stands.
   ::munmap(address, length);
-  if (!sealAgainstChange(memfd.get())) return {};
+  if (!sealMemory(memfd.get())) return {};
   return memfd;
 }
 

@@ -15,14 +15,6 @@ namespace {
 // The payload's first byte.
 enum class Travels : std::uint8_t { here = 0, inMemory = 1 };
 
-UniqueFd sealedCopy(std::span<const std::byte> bytes) {
-  UniqueFd memory = makeSealableMemory("brenvik-message");
-  if (!memory.isValid() || writeAll(memory.get(), bytes) != 0 || !sealMemory(memory.get())) {
-    throw std::bad_alloc();
-  }
-  return memory;
-}
-
 }  // namespace
 
 WorkerMessage packLarge(std::uint32_t kind, std::vector<std::byte> payload,
@@ -33,7 +25,9 @@ WorkerMessage packLarge(std::uint32_t kind, std::vector<std::byte> payload,
     message.payload = std::move(payload);
   } else {
     message.payload.push_back(static_cast<std::byte>(Travels::inMemory));
-    message.descriptors.insert(message.descriptors.begin(), sealedCopy(payload));
+    UniqueFd memory = makeSealedMemory("brenvik-message", payload);
+    if (!memory.isValid()) throw std::bad_alloc();
+    message.descriptors.insert(message.descriptors.begin(), std::move(memory));
   }
   return message;
 }
@@ -50,7 +44,7 @@ std::optional<LargePayload> LargePayload::open(WorkerMessage message) noexcept {
   if (::fstat(descriptors[0].get(), &status) != 0 || status.st_size < 0 ||
       static_cast<std::uint64_t>(status.st_size) > kLongestLargePayload ||
       SealedMemory::map(descriptors[0].get(), static_cast<std::size_t>(status.st_size), &opened.memory_) !=
-          WorkerResult::done) {
+          0) {
     return std::nullopt;
   }
   descriptors.erase(descriptors.begin());

@@ -8,8 +8,8 @@
 #include <span>
 #include <vector>
 
+#include "platform/datagram/SealedMemory.h"
 #include "platform/worker/WorkerChannel.h"
-#include "platform/worker/linux/SealedMemory.h"
 
 namespace brenvik {
 

@@ -10,7 +10,7 @@
 #include <new>
 #include <utility>
 
-#include "platform/base/SealedMemory.h"
+#include "platform/datagram/SealedMemory.h"
 #include "platform/runloop/RunAndWait.h"
 
 namespace brenvik {
@@ -89,7 +89,7 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
       used = used_;
     }
     if (queue == nullptr || !used) return;
-    // Whoever waits for an answer waits until this is done.
+    // Whoever waits for an answer waits until this is done, so it is, however long memory is short.
     runAndWait(*queue, [this] { abandonAll(); });
   }
 

@@ -11,9 +11,8 @@
 #include <new>
 #include <utility>
 
-#include "platform/base/WriteAll.h"
+#include "platform/datagram/SealedMemory.h"
 #include "platform/network/GunzipMessages.h"
-#include "platform/worker/linux/SealedMemory.h"
 
 namespace brenvik {
 namespace {
@@ -29,9 +28,7 @@ UniqueFd duplicate(int fd) noexcept { return UniqueFd(::fcntl(fd, F_DUPFD_CLOEXE
 // The input's own memory, or a copy of it that is sealed. Invalid when there is no memory for it.
 UniqueFd sealedMemoryOf(const GunzipInput& input) noexcept {
   if (input.sealedMemory >= 0) return duplicate(input.sealedMemory);
-  UniqueFd memory = makeSealableMemory("brenvik-gzip");
-  if (!memory.isValid() || writeAll(memory.get(), input.bytes) != 0 || !sealMemory(memory.get())) return {};
-  return memory;
+  return makeSealedMemory("brenvik-gzip", input.bytes);
 }
 
 }  // namespace

@@ -5,7 +5,6 @@
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/time.h>
-#include <sys/un.h>
 
 #include <algorithm>
 #include <array>
@@ -16,8 +15,10 @@
 #include <utility>
 
 #include "interface/TelephonyMessages.h"
-#include "platform/base/UniqueFd.h"
 #include "platform/base/Utf8.h"
+#include "platform/datagram/Datagram.h"
+#include "platform/datagram/Deadline.h"
+#include "platform/datagram/LocalSocket.h"
 #include "platform/plist/PropertyList.h"
 #include "platform/plist/PropertyListCodec.h"
 
@@ -29,26 +30,18 @@ using std::chrono::microseconds;
 
 // One request at a time travels on a connection, so any number but 0 tells its reply.
 constexpr PortName kReplyNumber = 1;
-constexpr std::size_t kRegionOffset = (sizeof(TelephonyPushMessage) + 7) / 8 * 8;
+constexpr std::size_t kRegionOffset = regionOffsetAfter(sizeof(TelephonyPushMessage));
 
 TelephonyResult posixResult(int code) noexcept { return telephonyResult(kPosixErrorDomain, code); }
 
-// Waits for `events` on the socket; 0, or ETIMEDOUT.
-int waitFor(int fd, short events, Clock::time_point deadline) noexcept {
-  for (;;) {
-    const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - Clock::now());
-    if (left.count() <= 0) return ETIMEDOUT;
-    pollfd entry{fd, events, 0};
-    const int ready = ::poll(&entry, 1, static_cast<int>(left.count()));
-    if (ready > 0) return 0;
-    if (ready < 0 && errno != EINTR) return errno;
-  }
+// A daemon that never stops talking is not listened to after the deadline.
+int waitUntil(int fd, short events, Deadline deadline) noexcept {
+  return deadline.hasPassed() ? ETIMEDOUT : waitFor(fd, events, deadline);
 }
 
 class ChannelConnection final : public TelephonyDaemonConnection {
  public:
-  ChannelConnection(UniqueFd channel, Clock::time_point deadline, PropertyList client,
-                    std::function<void()> callback)
+  ChannelConnection(UniqueFd channel, Deadline deadline, PropertyList client, std::function<void()> callback)
       : channel_(std::move(channel)),
         deadline_(deadline),
         client_(std::move(client)),
@@ -104,36 +97,36 @@ class ChannelConnection final : public TelephonyDaemonConnection {
     message.ndr = kNdrRecord;
     // A push is a few short texts: it always fits one datagram, and one that does not is no push of ours.
     if (region.size() > kLargestDatagram - kRegionOffset) return EMSGSIZE;
-    std::vector<char> datagram(kRegionOffset + region.size());
-    std::memcpy(datagram.data(), &message, sizeof message);
-    std::memcpy(datagram.data() + kRegionOffset, region.data(), region.size());
+    constexpr std::array<std::byte, kRegionOffset - sizeof message> kPadding{};
+    const std::array parts{iovecOf(std::as_bytes(std::span(&message, 1))), iovecOf(kPadding),
+                           iovecOf(std::as_bytes(std::span(region)))};
     for (;;) {
-      if (::send(channel_.get(), datagram.data(), datagram.size(), MSG_DONTWAIT | MSG_NOSIGNAL) >= 0)
-        return 0;
-      if (errno == EINTR) continue;
-      if (errno == ECONNRESET) return EPIPE;
-      if (errno != EAGAIN) return errno;
-      if (const int code = waitFor(channel_.get(), POLLOUT, deadline_); code != 0) return code;
+      const int error = sendDatagram(channel_.get(), parts);
+      if (error == ECONNRESET) return EPIPE;
+      if (error != EAGAIN) return error;
+      if (const int code = waitUntil(channel_.get(), POLLOUT, deadline_); code != 0) return code;
     }
   }
 
   TelephonyResult receiveReply(std::int32_t id) {
     for (;;) {
-      if (const int code = waitFor(channel_.get(), POLLIN, deadline_); code != 0) return posixResult(code);
+      if (const int code = waitUntil(channel_.get(), POLLIN, deadline_); code != 0) return posixResult(code);
       // Longer than any reply, so that a datagram cut to a reply's size is not taken for one. No room is
       // given for control data: the kernel drops the descriptors that nobody asked for.
-      std::array<char, 64> bytes;
-      const ssize_t size = ::recv(channel_.get(), bytes.data(), bytes.size(), MSG_DONTWAIT);
-      if (size < 0 && (errno == EAGAIN || errno == EINTR)) continue;
-      if (size == 0 || (size < 0 && errno == ECONNRESET)) return posixResult(EPIPE);
-      if (size < 0) return posixResult(errno);
-      if (const auto result = resultIn({bytes.data(), static_cast<std::size_t>(size)}, id)) return *result;
+      std::array<std::byte, 64> bytes;
+      const iovec room{bytes.data(), bytes.size()};
+      ReceivedDatagram received;
+      const int error = receiveDatagram(channel_.get(), std::span(&room, 1), {}, {}, MSG_DONTWAIT, &received);
+      if (error == EAGAIN || error == EINTR) continue;
+      if (error == ECONNRESET || (error == 0 && received.length == 0)) return posixResult(EPIPE);
+      if (error != 0) return posixResult(error);
+      if (const auto result = resultIn(std::span(bytes).first(received.length), id)) return *result;
       if (callback_) callback_();
     }
   }
 
   // The result that the reply with this id carries; nothing when the bytes are no such reply.
-  static std::optional<TelephonyResult> resultIn(std::span<const char> bytes, std::int32_t id) noexcept {
+  static std::optional<TelephonyResult> resultIn(std::span<const std::byte> bytes, std::int32_t id) noexcept {
     constexpr std::size_t kStatusOnly = offsetof(TelephonyPushReply, result);
     if (bytes.size() != sizeof(TelephonyPushReply) && bytes.size() != kStatusOnly) return std::nullopt;
     TelephonyPushReply reply{};
@@ -146,7 +139,7 @@ class ChannelConnection final : public TelephonyDaemonConnection {
   }
 
   const UniqueFd channel_;
-  const Clock::time_point deadline_;
+  const Deadline deadline_;
   const PropertyList client_;
   const std::function<void()> callback_;
 };
@@ -167,12 +160,9 @@ void ChannelTelephonyDaemon::addIdentifierException(std::string_view identifier)
 std::unique_ptr<TelephonyDaemonConnection> ChannelTelephonyDaemon::create(
     std::function<void()> callback) noexcept try {
   const auto deadline = Clock::now() + patience_;
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  if (socketPath_.size() >= sizeof address.sun_path) return nullptr;
-  std::memcpy(address.sun_path, socketPath_.data(), socketPath_.size());
-
-  UniqueFd channel(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+  const auto address = socketAddress(socketPath_);
+  if (!address) return nullptr;
+  UniqueFd channel = makeSocket(Blocking::yes);
   if (!channel.isValid()) return nullptr;
   // A daemon that hangs stops accepting, and a full backlog holds connect() up; a non-blocking one would fail
   // at once when the daemon is merely busy. The send time-out bounds the wait.
@@ -183,7 +173,7 @@ std::unique_ptr<TelephonyDaemonConnection> ChannelTelephonyDaemon::create(
     timeOut.tv_sec = left.count() / 1'000'000;
     timeOut.tv_usec = left.count() % 1'000'000;
     if (::setsockopt(channel.get(), SOL_SOCKET, SO_SNDTIMEO, &timeOut, sizeof timeOut) != 0) return nullptr;
-    if (::connect(channel.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0) break;
+    if (connectSocket(channel.get(), *address) == 0) break;
     if (errno != EINTR) return nullptr;
   }
 
@@ -197,7 +187,7 @@ std::unique_ptr<TelephonyDaemonConnection> ChannelTelephonyDaemon::create(
   }
   PropertyList client = PropertyList::array(identifiers);
   if (!client) return nullptr;
-  return std::make_unique<ChannelConnection>(std::move(channel), deadline, std::move(client),
+  return std::make_unique<ChannelConnection>(std::move(channel), Deadline(deadline), std::move(client),
                                              std::move(callback));
 } catch (const std::bad_alloc&) {
   return nullptr;

@@ -18,6 +18,7 @@
 
 #include "interface/TelephonyMessages.h"
 #include "platform/base/UniqueFd.h"
+#include "platform/datagram/Datagram.h"
 #include "platform/plist/PropertyListCodec.h"
 
 namespace brenvik {
@@ -269,21 +270,10 @@ TEST_F(ChannelTelephonyDaemonTest, DescriptorsNobodyAskedForAreNotKept) {
   const auto before = open();
   pushAddress([](UniqueFd channel) {
     const auto request = receive(channel);
-    auto reply = replyTo(request);
-    iovec part{&reply, sizeof reply};
-    alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
-    msghdr message{};
-    message.msg_iov = &part;
-    message.msg_iovlen = 1;
-    message.msg_control = control.data();
-    message.msg_controllen = control.size();
-    cmsghdr* header = CMSG_FIRSTHDR(&message);
-    header->cmsg_level = SOL_SOCKET;
-    header->cmsg_type = SCM_RIGHTS;
-    header->cmsg_len = CMSG_LEN(sizeof(int));
-    const int fd = channel.get();
-    std::memcpy(CMSG_DATA(header), &fd, sizeof fd);
-    EXPECT_EQ(::sendmsg(channel.get(), &message, MSG_NOSIGNAL), static_cast<ssize_t>(sizeof reply));
+    const auto reply = replyTo(request);
+    const std::array parts{iovecOf(std::as_bytes(std::span(&reply, 1)))};
+    const std::array passed{channel.get()};
+    EXPECT_EQ(sendDatagram(channel.get(), parts, passed), 0);
   });
   EXPECT_EQ(open(), before + 1) << "the test's own listening socket";
 }

@@ -5,7 +5,6 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/ioctl.h>
-#include <sys/socket.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -15,6 +14,7 @@
 #include <vector>
 
 #include "platform/base/Environment.h"
+#include "platform/datagram/LocalSocket.h"
 #include "platform/ipc/linux/ServiceManagerSocket.h"
 #include "platform/log/Log.h"
 
@@ -27,9 +27,8 @@ using Clock = std::chrono::steady_clock;
 constexpr std::size_t kMaxConnections = 8;
 
 bool isRoots(int connection) noexcept {
-  ucred peer{};
-  socklen_t size = sizeof peer;
-  return ::getsockopt(connection, SOL_SOCKET, SO_PEERCRED, &peer, &size) == 0 && peer.uid == 0;
+  const auto peer = peerOf(connection);
+  return peer && peer->uid == 0;
 }
 
 // Standard input, which is taken away, when the helper has put its connection there.

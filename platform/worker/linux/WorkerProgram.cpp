@@ -2,13 +2,9 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/worker/linux/WorkerProgram.h"
 
-#include <fcntl.h>
 #include <limits.h>
 #include <poll.h>
-#include <spawn.h>
-#include <sys/socket.h>
 #include <sys/syscall.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -16,11 +12,12 @@
 #include <array>
 #include <cerrno>
 #include <csignal>
-#include <cstring>
 #include <new>
 #include <utility>
 
 #include "platform/base/ErrorText.h"
+#include "platform/base/Spawn.h"
+#include "platform/datagram/LocalSocket.h"
 #include "platform/log/Log.h"
 
 namespace brenvik {
@@ -161,26 +158,23 @@ WorkerResult WorkerProgram::reach() {
 
 // `closed` when nobody listens.
 WorkerResult WorkerProgram::connectToService() {
-  const std::string path = description_.bootstrap + "/" + description_.service;
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  if (path.size() >= sizeof address.sun_path) return WorkerResult::closed;
-  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-  UniqueFd socket(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  const auto address = socketAddress(description_.bootstrap, description_.service);
+  if (!address) return WorkerResult::closed;
+  UniqueFd socket = makeSocket(Blocking::no);
   if (!socket.isValid()) return WorkerResult::outOfMemory;
   int error = 0;
-  if (::connect(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
+  if (connectSocket(socket.get(), *address) != 0) {
     error = errno;
     if (error == ENOENT || error == ECONNREFUSED) return WorkerResult::closed;
   } else {
-    ucred peer{};
-    socklen_t size = sizeof peer;
-    if (::getsockopt(socket.get(), SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) error = errno;
+    const auto peer = peerOf(socket.get());
+    if (!peer) error = errno;
     // Whoever listens was root's service manager; its folder is root's anyway.
-    if (error == 0 && peer.uid != 0 && peer.uid != ::geteuid()) error = EACCES;
+    if (peer && peer->uid != 0 && peer->uid != ::geteuid()) error = EACCES;
   }
   if (error != 0) {
-    if (mayLog()) logUnified(LogLevel::error, "cannot connect to %s: %s", path.c_str(), describeError(error));
+    if (mayLog())
+      logUnified(LogLevel::error, "cannot connect to %s: %s", address->sun_path, describeError(error));
     return WorkerResult::unavailable;
   }
   connection_ = WorkerChannel(std::move(socket));
@@ -214,36 +208,16 @@ WorkerResult WorkerProgram::startChild() {
 // error. That may be a terminal, so the worker has a session of its own: whoever has a terminal as its
 // session's can type into it. Nor has it this process's folder, to which it could not walk by itself.
 int WorkerProgram::start(const std::string& path, int theirs) {
-  posix_spawn_file_actions_t actions;
-  posix_spawnattr_t attributes;
-  if (const int error = ::posix_spawn_file_actions_init(&actions); error != 0) return error;
-  if (const int error = ::posix_spawnattr_init(&attributes); error != 0) {
-    ::posix_spawn_file_actions_destroy(&actions);
-    return error;
-  }
-  sigset_t all;
-  sigset_t none;
-  ::sigfillset(&all);
-  ::sigemptyset(&none);
+  Spawn spawn;
+  spawn.give(theirs, STDIN_FILENO);
+  spawn.giveNothing(STDOUT_FILENO);
+  spawn.enterFolder("/");
+  spawn.startSession();
   std::string name = description_.program;
   char* const arguments[] = {name.data(), nullptr};
   char* const environment[] = {nullptr};
-  int error = ::posix_spawn_file_actions_adddup2(&actions, theirs, STDIN_FILENO);
-  if (error == 0)
-    error = ::posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
-  if (error == 0) error = ::posix_spawn_file_actions_addchdir_np(&actions, "/");
-  if (error == 0) error = ::posix_spawn_file_actions_addclosefrom_np(&actions, STDERR_FILENO + 1);
-  if (error == 0) error = ::posix_spawnattr_setsigdefault(&attributes, &all);
-  if (error == 0) error = ::posix_spawnattr_setsigmask(&attributes, &none);
-  if (error == 0) {
-    constexpr int kFlags = POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSID;
-    error = ::posix_spawnattr_setflags(&attributes, static_cast<short>(kFlags));
-  }
   pid_t pid = -1;
-  if (error == 0) error = ::posix_spawn(&pid, path.c_str(), &actions, &attributes, arguments, environment);
-  ::posix_spawnattr_destroy(&attributes);
-  ::posix_spawn_file_actions_destroy(&actions);
-  if (error != 0) return error;
+  if (const int error = spawn.start(path.c_str(), arguments, environment, &pid); error != 0) return error;
   child_.pid = pid;
   child_.process.reset(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
   return 0;

@@ -26,10 +26,10 @@
 
 #include "platform/base/ProcessFacts.h"
 #include "platform/base/fakes/LingeringSocket.h"
+#include "platform/datagram/SealedMemory.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/worker/WorkerFields.h"
-#include "platform/worker/linux/SealedMemory.h"
 #include "platform/worker/linux/WorkerHost.h"
 #include "platform/worker/linux/WorkerRights.h"
 #include "testing/Works.h"
@@ -365,9 +365,9 @@ TEST_F(WorkerProgramTest, SealedMemoryArrivesAndMemoryThatCanChangeIsRefused) {
   ASSERT_EQ(receive(channel), WorkerResult::done);
   ASSERT_EQ(message.descriptors.size(), 1U);
   SealedMemory memory;
-  EXPECT_EQ(SealedMemory::map(message.descriptors[0].get(), 99'999, &memory), WorkerResult::malformed);
-  EXPECT_EQ(SealedMemory::map(message.descriptors[0].get(), 100'001, &memory), WorkerResult::malformed);
-  ASSERT_EQ(SealedMemory::map(message.descriptors[0].get(), 100'000, &memory), WorkerResult::done);
+  EXPECT_EQ(SealedMemory::map(message.descriptors[0].get(), 99'999, &memory), EBADMSG);
+  EXPECT_EQ(SealedMemory::map(message.descriptors[0].get(), 100'001, &memory), EBADMSG);
+  ASSERT_EQ(SealedMemory::map(message.descriptors[0].get(), 100'000, &memory), 0);
   message.descriptors.clear();
   ASSERT_EQ(memory.bytes().size(), 100'000U);
   EXPECT_EQ(memory.bytes().back(), std::byte{'x'});
@@ -377,9 +377,9 @@ TEST_F(WorkerProgramTest, SealedMemoryArrivesAndMemoryThatCanChangeIsRefused) {
   ASSERT_EQ(open(worker, WorkForTests::openMemory, &channel), WorkerResult::done);
   ASSERT_EQ(receive(channel), WorkerResult::done);
   ASSERT_EQ(message.descriptors.size(), 1U);
-  EXPECT_EQ(SealedMemory::map(message.descriptors[0].get(), 100'000, &memory), WorkerResult::malformed);
+  EXPECT_EQ(SealedMemory::map(message.descriptors[0].get(), 100'000, &memory), EBADMSG);
   const UniqueFd file(::open("/etc/passwd", O_RDONLY | O_CLOEXEC));
-  EXPECT_EQ(SealedMemory::map(file.get(), 0, &memory), WorkerResult::malformed);
+  EXPECT_EQ(SealedMemory::map(file.get(), 0, &memory), EBADMSG);
 }
 
 // ---- behind the socket of the named service

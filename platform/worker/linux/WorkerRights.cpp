@@ -143,49 +143,57 @@ bool refuseForeignCalls() noexcept {
   return ::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program, 0, 0) == 0;
 }
 
-}  // namespace
+// Leaves root's account; null, or in words what went wrong, as giveUpRights(). *kept are the capabilities
+// that stay.
+const char* leaveRoot(const WorkerRights& rights, std::vector<int>* kept) {
+  const std::optional<Ids> ids = accountFor(rights);
+  if (!ids) return "the account does not exist";
+  const bool isRoots = ids->uid == 0 || ids->gid == 0;
+  if (isRoots && !isOnlyAccount()) return "the account is root's";
+  if (rights.keptCapabilities) *kept = rights.keptCapabilities(ids->gid);
+  // Else they go with the account.
+  if (!kept->empty() && ::prctl(PR_SET_KEEPCAPS, 1, 0, 0, 0) != 0) return "no capability can be kept";
+  const Became became = isRoots ? Became::onlyAccount : become(*ids);
+  if (became == Became::nothing) return "root's account cannot be left";
+  if (became == Became::onlyAccount) return nullptr;
+  // Before the way back is tried, which they would open.
+  if (!setCapabilities(*kept)) return "capabilities cannot be dropped";
+  return isOrdinaryForGood() ? nullptr : "root's account can be had again";
+}
 
-const char* giveUpRights(const WorkerRights& rights) noexcept {
-  std::vector<int> kept;
-  try {
-    if (::geteuid() == 0 || ::getuid() == 0) {
-      const std::optional<Ids> ids = accountFor(rights);
-      if (!ids) return "the account does not exist";
-      const bool isRoots = ids->uid == 0 || ids->gid == 0;
-      if (isRoots && !isOnlyAccount()) return "the account is root's";
-      if (rights.keptCapabilities) kept = rights.keptCapabilities(ids->gid);
-      // Else they go with the account.
-      if (!kept.empty() && ::prctl(PR_SET_KEEPCAPS, 1, 0, 0, 0) != 0) return "no capability can be kept";
-      const Became became = isRoots ? Became::onlyAccount : become(*ids);
-      if (became == Became::nothing) return "root's account cannot be left";
-      if (became == Became::account) {
-        // Before the way back is tried, which they would open.
-        if (!setCapabilities(kept)) return "capabilities cannot be dropped";
-        if (!isOrdinaryForGood()) return "root's account can be had again";
-      }
-    } else if (rights.keptCapabilities) {
-      // The service manager has said already what it may keep.
-      kept = rights.keptCapabilities(::getegid());
-      if (!setCapabilities(kept)) kept.clear();
-    }
-  } catch (const std::bad_alloc&) {
-    return "out of memory";
-  }
+// Drops all capabilities but these, and bars every way to get others.
+const char* keepOnly(const std::vector<int>& kept) noexcept {
   (void)::prctl(PR_CAP_AMBIENT, PR_CAP_AMBIENT_CLEAR_ALL, 0, 0, 0);  // kernels without them have none
   if (!setCapabilities(kept) || !hasOnly(kept)) return "capabilities cannot be dropped";
   if (::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) return "new privileges cannot be refused";
-  if (::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0) != 0) return "other processes can look into it";
+  return ::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0) == 0 ? nullptr : "other processes can look into it";
+}
+
+const char* setLimits(const WorkerRights& rights) noexcept {
   if (!limit(RLIMIT_CORE, 0) || !limit(RLIMIT_NOFILE, rights.descriptors)) return "it cannot be limited";
 #if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
   if (rights.addressSpace != 0 && !limit(RLIMIT_AS, rights.addressSpace))
     return "its memory cannot be limited";
 #endif
-  try {
-    if (rights.isLocalOnly && !refuseForeignCalls()) return "system calls cannot be refused";
-  } catch (const std::bad_alloc&) {
-    return "out of memory";
-  }
   return nullptr;
+}
+
+}  // namespace
+
+const char* giveUpRights(const WorkerRights& rights) noexcept try {
+  std::vector<int> kept;
+  if (::geteuid() == 0 || ::getuid() == 0) {
+    if (const char* const why = leaveRoot(rights, &kept); why != nullptr) return why;
+  } else if (rights.keptCapabilities) {
+    // The service manager has said already what it may keep.
+    kept = rights.keptCapabilities(::getegid());
+    if (!setCapabilities(kept)) kept.clear();
+  }
+  if (const char* const why = keepOnly(kept); why != nullptr) return why;
+  if (const char* const why = setLimits(rights); why != nullptr) return why;
+  return !rights.isLocalOnly || refuseForeignCalls() ? nullptr : "system calls cannot be refused";
+} catch (const std::bad_alloc&) {
+  return "out of memory";
 }
 
 }  // namespace brenvik

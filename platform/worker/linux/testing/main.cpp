@@ -13,9 +13,9 @@
 #include <thread>
 #include <utility>
 
+#include "platform/datagram/SealedMemory.h"
 #include "platform/log/linux/SystemLog.h"
 #include "platform/worker/WorkerFields.h"
-#include "platform/worker/linux/SealedMemory.h"
 #include "platform/worker/linux/WorkerHost.h"
 #include "testing/Works.h"
 

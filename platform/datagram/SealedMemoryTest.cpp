@@ -1,11 +1,16 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/base/SealedMemory.h"
+#include "platform/datagram/SealedMemory.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/mman.h>
 #include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <utility>
+#include <vector>
 
 #include "platform/base/UniqueFd.h"
 
@@ -21,12 +26,12 @@ UniqueFd memoryOf(off_t size) {
 TEST(SealedMemoryTest, WhatIsSealedHasASizeForGood) {
   const UniqueFd memory = memoryOf(5000);
   EXPECT_EQ(sizeOfSealedMemory(memory.get()), -1);
-  EXPECT_TRUE(sealAgainstChange(memory.get()));
+  EXPECT_TRUE(sealMemory(memory.get()));
   EXPECT_EQ(sizeOfSealedMemory(memory.get()), 5000);
   EXPECT_NE(::ftruncate(memory.get(), 4999), 0);
   EXPECT_NE(::ftruncate(memory.get(), 5001), 0);
   EXPECT_NE(::pwrite(memory.get(), "x", 1, 0), 1);
-  EXPECT_FALSE(sealAgainstChange(memory.get())) << "no further seals";
+  EXPECT_FALSE(sealMemory(memory.get())) << "no further seals";
 }
 
 TEST(SealedMemoryTest, EachOfTheThreeSealsIsNeeded) {
@@ -50,8 +55,22 @@ TEST(SealedMemoryTest, NothingElseHasASize) {
 TEST(SealedMemoryTest, MemoryOfHugePagesHasNone) {
   const UniqueFd huge(::memfd_create("test", MFD_CLOEXEC | MFD_ALLOW_SEALING | MFD_HUGETLB));
   if (!huge.isValid()) GTEST_SKIP() << "no huge pages here";
-  ASSERT_TRUE(sealAgainstChange(huge.get()));
+  ASSERT_TRUE(sealMemory(huge.get()));
   EXPECT_EQ(sizeOfSealedMemory(huge.get()), -1);
+}
+
+TEST(SealedMemoryTest, BytesAreSealedInAndMappedByWhoeverGetsThem) {
+  const std::vector<std::byte> bytes(100'000, std::byte{7});
+  const UniqueFd memory = makeSealedMemory("test", bytes);
+  ASSERT_TRUE(memory.isValid());
+  SealedMemory mapped;
+  EXPECT_EQ(SealedMemory::map(memory.get(), bytes.size() - 1, &mapped), EBADMSG);
+  EXPECT_EQ(SealedMemory::map(memory.get(), bytes.size() + 1, &mapped), EBADMSG);
+  EXPECT_TRUE(mapped.bytes().empty());
+  ASSERT_EQ(SealedMemory::map(memory.get(), bytes.size(), &mapped), 0);
+  const SealedMemory moved = std::move(mapped);
+  EXPECT_TRUE(std::equal(bytes.begin(), bytes.end(), moved.bytes().begin(), moved.bytes().end()));
+  EXPECT_EQ(SealedMemory::map(makeSealedMemory("test", {}).get(), 0, &mapped), 0) << "nothing to be mapped";
 }
 
 }  // namespace

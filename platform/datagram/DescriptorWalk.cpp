@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/ipc/linux/DescriptorWalk.h"
+#include "platform/datagram/DescriptorWalk.h"
 
 #include <cstring>
 
@@ -17,8 +17,6 @@ Value read(std::span<const std::byte> datagram, std::size_t offset) noexcept {
 constexpr std::size_t kTypeOffset = offsetof(PortDescriptor, type);
 static_assert(kTypeOffset == offsetof(OutOfLineDescriptor, type),
               "the walk tells descriptors apart by this byte");
-
-constexpr std::size_t roundUp8(std::size_t value) noexcept { return (value + 7) & ~std::size_t{7}; }
 
 bool hasInLineRegion(std::span<const std::byte> datagram, std::size_t end) noexcept {
   DescriptorCursor cursor(datagram, end);
@@ -74,8 +72,8 @@ std::optional<DescriptorWalk> walkDescriptors(std::span<const std::byte> datagra
   while (const auto descriptor = cursor.next()) {
     if (descriptor->kind == WalkedDescriptor::Kind::inLineRegion) {
       const std::size_t start = descriptor->regionOffset;
-      if (regionsEnd == 0 ? start != roundUp8(end) : start < regionsEnd) return std::nullopt;
-      if (start % 8 != 0 || start > datagram.size()) return std::nullopt;
+      if (regionsEnd == 0 ? start != regionOffsetAfter(end) : start < regionsEnd) return std::nullopt;
+      if (start % kRegionAlignment != 0 || start > datagram.size()) return std::nullopt;
       if (datagram.size() - start < descriptor->regionLength) return std::nullopt;
       regionsEnd = start + descriptor->regionLength;
     } else if (descriptor->kind != WalkedDescriptor::Kind::emptyRegion) {
