@@ -8,7 +8,7 @@
 #include <unordered_map>
 
 #include "platform/base/Utf8.h"
-#include "platform/plist/Document.h"
+#include "platform/plist/internal/Document.h"
 
 namespace brenvik {
 

@@ -5,11 +5,11 @@
 #include <new>
 #include <string_view>
 
-#include "platform/plist/BinaryReader.h"
-#include "platform/plist/BinaryWriter.h"
-#include "platform/plist/Document.h"
-#include "platform/plist/XmlReader.h"
-#include "platform/plist/XmlWriter.h"
+#include "platform/plist/internal/BinaryReader.h"
+#include "platform/plist/internal/BinaryWriter.h"
+#include "platform/plist/internal/Document.h"
+#include "platform/plist/internal/XmlReader.h"
+#include "platform/plist/internal/XmlWriter.h"
 
 namespace brenvik {
 

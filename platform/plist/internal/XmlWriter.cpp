@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/plist/XmlWriter.h"
+#include "platform/plist/internal/XmlWriter.h"
 
 #include <algorithm>
 #include <array>
@@ -11,8 +11,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/plist/Calendar.h"
-#include "platform/plist/Document.h"
+#include "platform/plist/internal/Calendar.h"
+#include "platform/plist/internal/Document.h"
 
 namespace brenvik::plist {
 namespace {

@@ -6,7 +6,7 @@
 #include <string>
 
 #include "platform/plist/Node.h"
-#include "platform/plist/XmlSize.h"
+#include "platform/plist/internal/XmlSize.h"
 
 // Internal to this folder.
 namespace brenvik::plist {

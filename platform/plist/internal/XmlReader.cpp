@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/plist/XmlReader.h"
+#include "platform/plist/internal/XmlReader.h"
 
 #include <algorithm>
 #include <array>
@@ -11,11 +11,11 @@
 #include <vector>
 
 #include "platform/base/Utf8.h"
-#include "platform/plist/Calendar.h"
-#include "platform/plist/Document.h"
-#include "platform/plist/Text.h"
-#include "platform/plist/XmlEncoding.h"
-#include "platform/plist/XmlSize.h"
+#include "platform/plist/internal/Calendar.h"
+#include "platform/plist/internal/Document.h"
+#include "platform/plist/internal/Text.h"
+#include "platform/plist/internal/XmlEncoding.h"
+#include "platform/plist/internal/XmlSize.h"
 
 namespace brenvik::plist {
 namespace {

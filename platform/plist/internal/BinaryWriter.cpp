@@ -1,15 +1,15 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/plist/BinaryWriter.h"
+#include "platform/plist/internal/BinaryWriter.h"
 
 #include <algorithm>
 #include <bit>
 #include <cstring>
 #include <vector>
 
-#include "platform/plist/BinaryReader.h"
-#include "platform/plist/Document.h"
-#include "platform/plist/XmlSize.h"
+#include "platform/plist/internal/BinaryReader.h"
+#include "platform/plist/internal/Document.h"
+#include "platform/plist/internal/XmlSize.h"
 
 namespace brenvik::plist {
 namespace {

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/plist/Document.h"
+#include "platform/plist/internal/Document.h"
 
 #include <sys/random.h>
 

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/plist/BinaryReader.h"
+#include "platform/plist/internal/BinaryReader.h"
 
 #include <algorithm>
 #include <bit>
@@ -10,9 +10,9 @@
 #include <new>
 #include <vector>
 
-#include "platform/plist/Document.h"
-#include "platform/plist/Text.h"
-#include "platform/plist/XmlSize.h"
+#include "platform/plist/internal/Document.h"
+#include "platform/plist/internal/Text.h"
+#include "platform/plist/internal/XmlSize.h"
 
 namespace brenvik::plist {
 namespace {
