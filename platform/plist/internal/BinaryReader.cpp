@@ -8,8 +8,10 @@
 #include <cstring>
 #include <memory>
 #include <new>
+#include <span>
 #include <vector>
 
+#include "platform/plist/internal/BinaryFormat.h"
 #include "platform/plist/internal/Document.h"
 #include "platform/plist/internal/Text.h"
 #include "platform/plist/internal/XmlSize.h"
@@ -17,49 +19,38 @@
 namespace brenvik::plist {
 namespace {
 
-std::uint64_t loadBig(const unsigned char* bytes, std::size_t width) noexcept {
-  switch (width) {
-    case 1:
-      return bytes[0];
-    case 2:
-      return std::uint64_t{bytes[0]} << 8 | bytes[1];
-    case 4: {
-      std::uint32_t word;
-      std::memcpy(&word, bytes, sizeof word);
-      return __builtin_bswap32(word);
-    }
-    case 8: {
-      std::uint64_t word;
-      std::memcpy(&word, bytes, sizeof word);
-      return __builtin_bswap64(word);
-    }
-    default: {
-      std::uint64_t value = 0;
-      for (std::size_t i = 0; i < width; ++i) value = value << 8 | bytes[i];
-      return value;
-    }
-  }
-}
-
 class Reader {
  public:
-  explicit Reader(std::string_view bytes)
-      : begin_(reinterpret_cast<const unsigned char*>(bytes.data())),
-        size_(bytes.size()),
-        document_(std::min(bytes.size() + 64, kFirstBlock)) {}
+  // A whole document.
+  explicit Reader(std::string_view bytes) : Reader(bytes, bytes.size()) {}
+  // Objects that begin at these offsets; the top is the first, and references count from `first`.
+  Reader(std::string_view bytes, std::span<const std::uint32_t> offsets, std::size_t first,
+         std::size_t referenceWidth)
+      : Reader(bytes, bytes.size() - offsets.front()) {
+    end_ = begin_ + size_;
+    offsets_ = offsets.data();
+    objects_ = offsets.size();
+    first_ = first;
+    referenceWidth_ = referenceWidth;
+  }
+  // Of a whole document: finds its objects. False when it is malformed.
+  bool readTrailer();
+  // The top object's value.
   PropertyList read();
 
  private:
   static constexpr std::size_t kFirstBlock = std::size_t{64} << 10;
 
+  Reader(std::string_view bytes, std::size_t objectBytes)
+      : begin_(reinterpret_cast<const unsigned char*>(bytes.data())),
+        size_(bytes.size()),
+        document_(std::min(objectBytes + 64, kFirstBlock)),
+        unspent_(objectBytes) {}
+
   // What is known of an object of the file.
   struct Slot {
     Node node;           // tag none: not looked at yet; pending: a container on the path from the top
     std::uint32_t done;  // of a finished container with children: its place in done_
-  };
-  struct Measure {
-    XmlExtent extent;  // at least
-    std::size_t height;
   };
   struct Frame {
     std::size_t object;
@@ -74,14 +65,25 @@ class Reader {
     void operator()(void* memory) const noexcept { std::free(memory); }
   };
 
-  bool readTrailer();
   bool readObject(std::size_t object);
-  bool readInteger(const unsigned char* at, std::size_t width, Node& node);
-  bool readText(unsigned char marker, const unsigned char* at, std::size_t count, Node& node);
-  bool beginContainer(std::size_t object, bool isDictionary, const unsigned char* at, std::size_t count);
-  bool endContainer();
+  bool readInteger(const unsigned char* at, unsigned power, Node& node);
+  bool readReal(const unsigned char* at, unsigned power, Node& node);
+  bool readDate(const unsigned char* at, unsigned power, Node& node);
+  bool readUid(const unsigned char* at, std::size_t width, Slot& slot);
+  bool readText(const ObjectHead& head, const unsigned char* at, Node& node);
+  bool beginContainer(std::size_t object, const ObjectHead& head, const unsigned char* at);
+  void endContainer();
   bool walk();
-  std::size_t before(const unsigned char* at) const noexcept { return static_cast<std::size_t>(table_ - at); }
+  bool step();
+  bool addToFrame(Slot& slot);
+  Measure measureOf(const Slot& slot) const noexcept {
+    const bool isFull = slot.node.isContainer() && slot.node.size != 0;
+    return isFull ? done_[slot.done] : leafMeasure(slot.node);
+  }
+  std::uint64_t offsetOf(std::size_t object) const noexcept {
+    return offsets_ != nullptr ? offsets_[object] : loadBig(end_ + object * offsetWidth_, offsetWidth_);
+  }
+  std::size_t before(const unsigned char* at) const noexcept { return static_cast<std::size_t>(end_ - at); }
   // Counts an object's bytes. Objects do not overlap, so that all of them together are no more than there are
   // bytes; a file whose objects do could make us copy one range again and again.
   bool spend(std::size_t bytes) noexcept {
@@ -94,12 +96,14 @@ class Reader {
   std::size_t size_;
   DocumentHolder document_;
 
-  const unsigned char* table_ = nullptr;  // of offsets; objects end before it
+  const unsigned char* end_ = nullptr;      // of the objects; in a whole document the offsets begin here
+  const std::uint32_t* offsets_ = nullptr;  // where they are not in the document
   std::size_t offsetWidth_ = 0;
   std::size_t referenceWidth_ = 0;
   std::size_t objects_ = 0;
   std::size_t top_ = 0;
-  std::size_t unspent_ = 0;
+  std::size_t first_ = 0;  // what references count from
+  std::size_t unspent_;
   std::size_t references_ = 0;
 
   std::unique_ptr<Slot[], Free> slots_;
@@ -108,30 +112,29 @@ class Reader {
 };
 
 bool Reader::readTrailer() {
-  if (size_ < kBinaryMagic.size() + kBinaryTrailer ||
+  if (size_ < kBinaryMagic.size() + kTrailerSize ||
       std::memcmp(begin_, kBinaryMagic.data(), kBinaryMagic.size()) != 0) {
     return false;
   }
-  const unsigned char* const trailer = begin_ + size_ - kBinaryTrailer;
-  offsetWidth_ = trailer[6];
-  referenceWidth_ = trailer[7];
-  const std::uint64_t objects = loadBig(trailer + 8, 8);
-  const std::uint64_t top = loadBig(trailer + 16, 8);
-  const std::uint64_t table = loadBig(trailer + 24, 8);
-  if (offsetWidth_ < 1 || offsetWidth_ > 8 || referenceWidth_ < 1 || referenceWidth_ > 8) return false;
-  const std::size_t end = size_ - kBinaryTrailer;
+  const std::size_t end = size_ - kTrailerSize;
+  const auto [offsetWidth, referenceWidth, objects, top, table] = loadTrailer(begin_ + end);
+  if (offsetWidth < 1 || offsetWidth > 8 || referenceWidth < 1 || referenceWidth > 8) return false;
   if (table <= kBinaryMagic.size() || table > end) return false;
   // Each object has at least one byte of its own, and an offset.
   if (objects == 0 || top >= objects || objects > table - kBinaryMagic.size()) return false;
-  if (objects > (end - table) / offsetWidth_ || objects > UINT32_MAX) return false;
-  table_ = begin_ + table;
+  if (objects > (end - table) / offsetWidth || objects > UINT32_MAX) return false;
+  end_ = begin_ + table;
+  offsetWidth_ = offsetWidth;
+  referenceWidth_ = referenceWidth;
   objects_ = static_cast<std::size_t>(objects);
   top_ = static_cast<std::size_t>(top);
   unspent_ = static_cast<std::size_t>(table) - kBinaryMagic.size();
   return true;
 }
 
-bool Reader::readInteger(const unsigned char* at, std::size_t width, Node& node) {
+bool Reader::readInteger(const unsigned char* at, unsigned power, Node& node) {
+  const std::size_t width = std::size_t{1} << power;
+  if (power > 4 || before(at) < width || !spend(1 + width)) return false;
   node.tag = Tag::integer;
   if (width <= 8) {
     node.unsignedInteger = loadBig(at, width);  // of eight bytes: with its sign
@@ -147,14 +150,53 @@ bool Reader::readInteger(const unsigned char* at, std::size_t width, Node& node)
   return high == UINT64_MAX && topBit;
 }
 
-bool Reader::readText(unsigned char marker, const unsigned char* at, std::size_t count, Node& node) {
-  const std::size_t width = marker == 0x60 ? 2 : 1;
-  if (count > before(at) / width || !spend(count * width)) return false;
-  node.tag = marker == 0x40 ? Tag::data : Tag::string;
+bool Reader::readReal(const unsigned char* at, unsigned power, Node& node) {
+  const std::size_t width = std::size_t{1} << power;
+  if ((power != 2 && power != 3) || before(at) < width || !spend(1 + width)) return false;
+  const std::uint64_t bits = loadBig(at, width);
+  node.tag = Tag::real;
+  node.real = power == 3 ? std::bit_cast<double>(bits)
+                         : static_cast<double>(std::bit_cast<float>(static_cast<std::uint32_t>(bits)));
+  return true;
+}
+
+bool Reader::readDate(const unsigned char* at, unsigned power, Node& node) {
+  if (power != 3 || before(at) < 8 || !spend(9)) return false;
+  node.tag = Tag::date;
+  node.real = std::bit_cast<double>(loadBig(at, 8));
+  return true;
+}
+
+bool Reader::readUid(const unsigned char* at, std::size_t width, Slot& slot) {
+  if (width > 8 || before(at) < width || !spend(1 + width)) return false;
+  auto* const pair = static_cast<Node*>(document_->allocate(dictionaryBytes(1)));
+  pair[0] = Node();
+  pair[0].tag = Tag::string;
+  pair[0].text = kUidKey;
+  pair[0].size = sizeof kUidKey - 1;
+  setKeyHash(pair[0]);
+  pair[1] = Node();
+  pair[1].unsignedInteger = loadBig(at, width);
+  pair[1].tag = pair[1].integer < 0 ? Tag::unsignedInteger : Tag::integer;
+  slot.node = finishDictionary(pair, 1);
+  slot.done = static_cast<std::uint32_t>(done_.size());
+  Measure measure{tagExtent(Tag::dictionary), 1};
+  measure.addChild(leafMeasure(pair[0]));
+  measure.addChild(leafMeasure(pair[1]));
+  done_.push_back(measure);
+  return true;
+}
+
+bool Reader::readText(const ObjectHead& head, const unsigned char* at, Node& node) {
+  const bool isUtf16 = head.kind == kUtf16Object;
+  const std::size_t count = head.count;
+  const std::size_t width = isUtf16 ? 2 : 1;
+  if (count > before(at) / width || !spend(head.size + count * width)) return false;
+  node.tag = head.kind == kDataObject ? Tag::data : Tag::string;
   node.text = "";
   if (count == 0) return true;
   std::size_t size = count;
-  if (marker == 0x60) {
+  if (isUtf16) {
     char* const to = document_->allocateText(count * 3);
     char* const stop = utf8FromUtf16<ByteOrder::big>(at, count, to);
     document_->trim(stop == nullptr ? to : stop);
@@ -163,7 +205,7 @@ bool Reader::readText(unsigned char marker, const unsigned char* at, std::size_t
     size = static_cast<std::size_t>(stop - to);
   } else {
     const char* const from = reinterpret_cast<const char*>(at);
-    if (marker == 0x50 && !isAscii(from, count)) return false;
+    if (head.kind == kAsciiObject && !isAscii(from, count)) return false;
     node.text = document_->copyText(from, count);
   }
   if (size > UINT32_MAX) return false;
@@ -171,13 +213,13 @@ bool Reader::readText(unsigned char marker, const unsigned char* at, std::size_t
   return true;
 }
 
-bool Reader::beginContainer(std::size_t object, bool isDictionary, const unsigned char* at,
-                            std::size_t count) {
+bool Reader::beginContainer(std::size_t object, const ObjectHead& head, const unsigned char* at) {
   Node& node = slots_[object].node;
-  const std::size_t perEntry = isDictionary ? 2 : 1;
-  if (count > before(at) / referenceWidth_ / perEntry) return false;
-  const std::size_t references = count * perEntry;
-  if (!spend(references * referenceWidth_)) return false;
+  const bool isDictionary = head.kind == kDictionaryObject;
+  const std::size_t count = head.count;
+  if (count > before(at) / referenceWidth_ / (isDictionary ? 2 : 1)) return false;
+  const std::size_t references = head.references();
+  if (!spend(head.size + references * referenceWidth_)) return false;
   if (count == 0) {
     node.tag = isDictionary ? Tag::dictionary : Tag::array;
     node.children = nullptr;
@@ -194,7 +236,7 @@ bool Reader::beginContainer(std::size_t object, bool isDictionary, const unsigne
   return true;
 }
 
-bool Reader::endContainer() {
+void Reader::endContainer() {
   const Frame& frame = frames_.back();
   Slot& slot = slots_[frame.object];
   if (frame.isDictionary) {
@@ -207,149 +249,113 @@ bool Reader::endContainer() {
   slot.done = static_cast<std::uint32_t>(done_.size());
   done_.push_back(frame.measure);
   frames_.pop_back();
-  return true;
 }
 
 // Reads a scalar into its slot, or begins a container.
 bool Reader::readObject(std::size_t object) {
   Node& node = slots_[object].node;
-  const std::uint64_t offset = loadBig(table_ + object * offsetWidth_, offsetWidth_);
-  if (offset < kBinaryMagic.size() || offset >= static_cast<std::uint64_t>(table_ - begin_)) return false;
-  const unsigned char* at = begin_ + offset;
-  const unsigned char marker = *at++;
-  const unsigned char kind = marker & 0xF0;
-  const unsigned low = marker & 0x0F;
-  switch (kind) {
-    case 0x00:
-      if (marker != 0x08 && marker != 0x09) return false;
+  const std::uint64_t offset = offsetOf(object);
+  if (offset < kBinaryMagic.size() || offset >= static_cast<std::uint64_t>(end_ - begin_)) return false;
+  ObjectHead head;
+  if (!readHead(begin_ + offset, end_, &head)) return false;
+  const unsigned char* const at = begin_ + offset + head.size;
+  switch (head.kind) {
+    case kSimpleObject:
+      if (head.low != 8 && head.low != 9) return false;
       node.tag = Tag::boolean;
-      node.integer = marker == 0x09 ? 1 : 0;
+      node.integer = head.low == 9 ? 1 : 0;
       return spend(1);
-    case 0x10: {
-      const std::size_t width = std::size_t{1} << low;
-      if (low > 4 || before(at) < width || !spend(1 + width)) return false;
-      return readInteger(at, width, node);
-    }
-    case 0x20: {
-      const std::size_t width = std::size_t{1} << low;
-      if ((low != 2 && low != 3) || before(at) < width || !spend(1 + width)) return false;
-      const std::uint64_t bits = loadBig(at, width);
-      node.tag = Tag::real;
-      node.real = low == 3 ? std::bit_cast<double>(bits)
-                           : static_cast<double>(std::bit_cast<float>(static_cast<std::uint32_t>(bits)));
-      return true;
-    }
-    case 0x30:
-      if (low != 3 || before(at) < 8 || !spend(9)) return false;
-      node.tag = Tag::date;
-      node.real = std::bit_cast<double>(loadBig(at, 8));
-      return true;
-    case 0x80: {
-      const std::size_t width = low + 1;
-      if (width > 8 || before(at) < width || !spend(1 + width)) return false;
-      auto* const pair = static_cast<Node*>(document_->allocate(dictionaryBytes(1)));
-      pair[0] = Node();
-      pair[0].tag = Tag::string;
-      pair[0].text = kUidKey;
-      pair[0].size = sizeof kUidKey - 1;
-      setKeyHash(pair[0]);
-      pair[1] = Node();
-      pair[1].unsignedInteger = loadBig(at, width);
-      pair[1].tag = pair[1].integer < 0 ? Tag::unsignedInteger : Tag::integer;
-      node = finishDictionary(pair, 1);
-      slots_[object].done = static_cast<std::uint32_t>(done_.size());
-      Measure measure{tagExtent(Tag::dictionary), 1};
-      measure.extent.addChild(largestExtent(pair[0]));
-      measure.extent.addChild(largestExtent(pair[1]));
-      done_.push_back(measure);
-      return true;
-    }
-    case 0x40:
-    case 0x50:
-    case 0x60:
-    case 0xA0:
-    case 0xD0: {
-      std::uint64_t count = low;
-      std::size_t spent = 1;
-      if (low == 15) {
-        if (before(at) < 1 || (*at & 0xFC) != 0x10) return false;
-        const std::size_t width = std::size_t{1} << (*at++ & 3);
-        if (before(at) < width) return false;
-        count = loadBig(at, width);
-        at += width;
-        spent += 1 + width;
-      }
-      if (count > size_ || !spend(spent)) return false;
-      const auto few = static_cast<std::size_t>(count);
-      if (kind < 0xA0) return readText(kind, at, few, node);
-      return beginContainer(object, kind == 0xD0, at, few);
-    }
+    case kIntegerObject:
+      return readInteger(at, head.low, node);
+    case kRealObject:
+      return readReal(at, head.low, node);
+    case kDateObject:
+      return readDate(at, head.low, node);
+    case kUidObject:
+      return readUid(at, std::size_t{head.low} + 1, slots_[object]);
+    case kDataObject:
+    case kAsciiObject:
+    case kUtf16Object:
+      return readText(head, at, node);
+    case kArrayObject:
+    case kDictionaryObject:
+      return beginContainer(object, head, at);
     default:
       return false;
   }
+}
+
+// Looks at one more child of the container that was begun last. A child that is a container itself, and was
+// not looked at before, is begun, and looked at again when it is finished.
+bool Reader::step() {
+  const Frame& frame = frames_.back();
+  const std::uint64_t object =
+      loadBig(frame.references + frame.next * referenceWidth_, referenceWidth_) - first_;
+  if (object >= objects_) return false;
+  Slot& slot = slots_[object];
+  if (slot.node.tag == Tag::pending) return false;  // a container within itself
+  if (slot.node.tag == Tag::none) {
+    const std::size_t depth = frames_.size();
+    if (!readObject(object)) return false;
+    if (frames_.size() != depth) return true;
+  }
+  return addToFrame(slot);
+}
+
+bool Reader::addToFrame(Slot& slot) {
+  Frame& frame = frames_.back();
+  Node& node = slot.node;
+  frame.measure.addChild(measureOf(slot));
+  if (frames_.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
+  const std::size_t entries = frame.count / 2;
+  if (!frame.isDictionary) {
+    frame.children[frame.next] = node;
+  } else if (frame.next >= entries) {
+    frame.children[2 * (frame.next - entries) + 1] = node;
+  } else {
+    if (node.tag != Tag::string) return false;
+    if (node.hash[0] == 0 && node.hash[1] == 0 && node.hash[2] == 0) setKeyHash(node);
+    frame.children[2 * frame.next] = node;
+  }
+  ++frame.next;
+  return true;
 }
 
 // Depth first from the top, looking at each object once. The path is never longer than the levels allowed.
 bool Reader::walk() {
   if (!readObject(top_)) return false;
   while (!frames_.empty()) {
-    Frame& frame = frames_.back();
-    if (frame.next == frame.count) {
-      if (!endContainer()) return false;
-      continue;
+    if (frames_.back().next == frames_.back().count) {
+      endContainer();
+    } else if (!step()) {
+      return false;
     }
-    const std::uint64_t object = loadBig(frame.references + frame.next * referenceWidth_, referenceWidth_);
-    if (object >= objects_) return false;
-    Slot& slot = slots_[object];
-    Node& node = slot.node;
-    if (node.tag == Tag::none) {
-      const std::size_t depth = frames_.size();
-      if (!readObject(object)) return false;
-      if (frames_.size() != depth) continue;  // a container: looked at again when it is finished
-    } else if (node.tag == Tag::pending) {
-      return false;  // a container within itself
-    }
-    // The frame may have moved only in the case left above.
-    const bool isFull = node.isContainer() && node.size != 0;
-    const Measure child =
-        isFull ? done_[slot.done] : Measure{largestExtent(node), std::size_t{node.isContainer()}};
-    frame.measure.extent.addChild(child.extent);
-    frame.measure.height = std::max(frame.measure.height, child.height + 1);
-    if (frames_.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
-    if (!frame.isDictionary) {
-      frame.children[frame.next] = node;
-    } else {
-      const std::size_t entries = frame.count / 2;
-      if (frame.next < entries) {
-        if (node.tag != Tag::string) return false;
-        if (node.hash[0] == 0 && node.hash[1] == 0 && node.hash[2] == 0) setKeyHash(node);
-        frame.children[2 * frame.next] = node;
-      } else {
-        frame.children[2 * (frame.next - entries) + 1] = node;
-      }
-    }
-    ++frame.next;
   }
   return true;
 }
 
 PropertyList Reader::read() {
-  if (!readTrailer()) return {};
   // Zeroed memory is a slot not looked at, and pages of objects that nothing refers to stay untouched.
   static_assert(static_cast<int>(Tag::none) == 0);
   slots_.reset(static_cast<Slot*>(std::calloc(objects_, sizeof(Slot))));
   if (slots_ == nullptr) throw std::bad_alloc();
   if (!walk()) return {};
   const Slot& top = slots_[top_];
-  const bool isFull = top.node.isContainer() && top.node.size != 0;
-  const XmlExtent most = isFull ? done_[top.done].extent : largestExtent(top.node);
-  if (!fitsXmlLimit(most) && !xmlFormFits(top.node)) return {};
+  if (!fitsXmlLimit(measureOf(top).extent) && !xmlFormFits(top.node)) return {};
   const bool inArena = top.node.size != 0;
   return Access::make(top.node, inArena ? document_.handOver() : nullptr);
 }
 
 }  // namespace
 
-PropertyList readBinary(std::string_view bytes) { return Reader(bytes).read(); }
+PropertyList readBinary(std::string_view bytes) {
+  Reader reader(bytes);
+  return reader.readTrailer() ? reader.read() : PropertyList();
+}
+
+PropertyList readObjects(std::string_view bytes, std::span<const std::uint32_t> offsets, std::size_t first,
+                         std::size_t referenceWidth) {
+  return Reader(bytes, offsets, first, referenceWidth).read();
+}
 
 }  // namespace brenvik::plist

@@ -8,7 +8,6 @@
 #include "platform/plist/Node.h"
 #include "platform/plist/internal/XmlSize.h"
 
-// Internal to this folder.
 namespace brenvik::plist {
 
 // Nothing when beyond a limit or when XML cannot carry a character or a date. Throws std::bad_alloc.

@@ -50,15 +50,15 @@ bool isPassing(int error) noexcept {
 }
 
 // What is wrong with a domain's file, or null and its content.
-const char* parse(std::string_view bytes, DomainImage& image) {
+const char* parse(std::string_view bytes, EditableDictionary& values) {
   CodecFailure failure{};
   const PropertyList document = parsePropertyList(std::as_bytes(std::span(bytes)), &failure);
   if (failure == CodecFailure::noMemory) throw std::bad_alloc();
   if (!document) return "not a property list";
   if (!document.is(PropertyList::Type::dictionary)) return "not a dictionary";
-  auto found = DomainImage::of(document);
+  auto found = EditableDictionary::of(document);
   if (!found) return "too large when taken apart";
-  image = std::move(*found);
+  values = std::move(*found);
   return nullptr;
 }
 
@@ -140,7 +140,7 @@ DomainFile::Attempt DomainFile::tryLoad() const {
   }
   const auto damaged = [&attempt](const char* what, int error = 0) -> Attempt {
     attempt.loaded.state = State::unavailable;
-    attempt.loaded.image = DomainImage();
+    attempt.loaded.values = EditableDictionary();
     attempt.damage = what;
     attempt.error = error;
     return std::move(attempt);
@@ -155,7 +155,8 @@ DomainFile::Attempt DomainFile::tryLoad() const {
     struct stat facts;
     if (::fstat(loaded.pin.get(), &facts) != 0) return passing(errno);
     if (!S_ISREG(facts.st_mode)) return damaged("not a regular file");
-    if (static_cast<std::uint64_t>(facts.st_size) > kLargestDomain) return damaged("too large");
+    if (static_cast<std::uint64_t>(facts.st_size) > EditableDictionary::kMaxFileSize)
+      return damaged("too large");
     loaded.stamp = stampOf(facts);
     bytes.resize(static_cast<std::size_t>(facts.st_size));
     std::size_t filled = 0;
@@ -173,7 +174,7 @@ DomainFile::Attempt DomainFile::tryLoad() const {
     if (stampOf(facts) == loaded.stamp || round == kReadAttempts) break;
   }
   // A lack of memory leaves by an exception: a good file is not to be moved aside for it.
-  if (const char* const damage = parse(bytes, loaded.image); damage != nullptr) return damaged(damage);
+  if (const char* const damage = parse(bytes, loaded.values); damage != nullptr) return damaged(damage);
   loaded.state = State::read;
   timespec now{};
   ::clock_gettime(CLOCK_REALTIME, &now);

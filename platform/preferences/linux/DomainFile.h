@@ -13,7 +13,7 @@
 #include <string_view>
 
 #include "platform/base/UniqueFd.h"
-#include "platform/preferences/linux/DomainImage.h"
+#include "platform/plist/EditableDictionary.h"
 
 namespace brenvik {
 
@@ -66,7 +66,7 @@ class DomainFile {
   };
   struct Loaded {
     State state = State::absent;
-    DomainImage image;
+    EditableDictionary values;
     FileStamp stamp;
     // Keeps the inode's number from being given to another file as long as the stamp is compared.
     UniqueFd pin;

@@ -17,8 +17,8 @@
 #include "platform/base/ErrorText.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
+#include "platform/plist/EditableDictionary.h"
 #include "platform/preferences/linux/DomainFile.h"
-#include "platform/preferences/linux/DomainImage.h"
 
 #ifndef BRENVIK_ANY_USER_PREFERENCES
 #error "the build says where the preferences of any user are"
@@ -91,7 +91,7 @@ class FilePreferences::Domain {
     if (const auto set = pending_.find(key); set != pending_.end()) return set->second;
     // Somebody may have replaced or removed the file since: one look, and a read only if it changed.
     if (!isCurrent()) load(nullptr);
-    return image_.find(key);
+    return values_.find(key);
   }
 
   bool synchronize() {
@@ -122,14 +122,14 @@ class FilePreferences::Domain {
   std::optional<std::size_t> weight() {
     const std::unique_lock lock(mutex_, std::try_to_lock);
     if (!lock.owns_lock() || !pending_.empty()) return std::nullopt;
-    return image_.memory();
+    return values_.memory();
   }
 
  private:
   bool isCurrent() const noexcept { return isLoaded_ && isSettled_ && file_.stamp() == stamp_; }
 
   void forgetContent() noexcept {
-    image_ = DomainImage();
+    values_ = EditableDictionary();
     stamp_ = {};
     pin_.reset();
     isLoaded_ = isDurable_ = canStore_ = false;
@@ -138,7 +138,7 @@ class FilePreferences::Domain {
   void load(const FolderLock* held) {
     forgetContent();
     DomainFile::Loaded loaded = file_.load(patience_, held);
-    image_ = std::move(loaded.image);
+    values_ = std::move(loaded.values);
     stamp_ = loaded.stamp;
     pin_ = std::move(loaded.pin);
     isSettled_ = loaded.isSettled;
@@ -155,13 +155,13 @@ class FilePreferences::Domain {
     bool isWhole = true;
     bool isChanged = false;
     for (const auto& [key, value] : pending_) {
-      switch (image_.set(key, value)) {
-        case DomainImage::Change::none:
+      switch (values_.set(key, value)) {
+        case EditableDictionary::Change::none:
           break;
-        case DomainImage::Change::made:
+        case EditableDictionary::Change::made:
           isChanged = true;
           break;
-        case DomainImage::Change::refused:
+        case EditableDictionary::Change::refused:
           logUnified(LogLevel::error, "Preferences %s: a value is too deep or too large to be stored",
                      path().c_str());
           isWhole = false;
@@ -173,7 +173,7 @@ class FilePreferences::Domain {
     const bool isStored = !isChanged && (isDurable_ || stamp_.size < 0);
     if (isStored) return isWhole;
     isDurable_ = false;
-    const auto content = image_.content();
+    const auto content = values_.content();
     if (!file_.replace(folder.get(), content, stamp_, pin_)) return false;
     isDurable_ = isSettled_ = true;
     return isWhole;
@@ -186,7 +186,7 @@ class FilePreferences::Domain {
 
   std::mutex mutex_;                                          // of what follows
   std::map<std::string, PropertyList, std::less<>> pending_;  // no value: to be removed
-  DomainImage image_;                                         // of the file
+  EditableDictionary values_;                                 // of the file
   FileStamp stamp_;
   UniqueFd pin_;
   bool isLoaded_ = false;
