@@ -163,12 +163,8 @@ std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource 
     for (const std::int32_t type : kDatabaseTypesInOrder) {
       if ((mask & static_cast<std::uint32_t>(type)) == 0) continue;
       try {
-        PropertyList record;
-        if (!parts_->preferences.readValue(keyOfDatabaseType(type), source, UserScope::currentUser,
-                                           HostScope::anyHost, &record)) {
-          throw std::bad_alloc();
-        }
-        versions_[type] = onlyDictionary(std::move(record));
+        versions_[type] = onlyDictionary(parts_->preferences.copyValue(
+            keyOfDatabaseType(type), source, UserScope::currentUser, HostScope::anyHost));
       } catch (const std::bad_alloc&) {
         versions_.erase(type);  // an earlier check's entry would be taken for the present one
         outOfMemory_ |= type;

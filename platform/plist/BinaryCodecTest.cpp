@@ -286,8 +286,8 @@ std::string nested(std::size_t levels) {
 }
 
 TEST(BinaryReaderTest, TakesTheDeepestDocumentAllowedAndNoneThatIsDeeper) {
-  EXPECT_TRUE(parse(nested(kDeepestPropertyList)));
-  EXPECT_FALSE(parse(nested(kDeepestPropertyList + 1)));
+  EXPECT_TRUE(parse(nested(kMaxPropertyListDepth)));
+  EXPECT_FALSE(parse(nested(kMaxPropertyListDepth + 1)));
   const std::string hostile = nested(100000);
   EXPECT_FALSE(parse(hostile));
   EXPECT_LT(peakMemory([&] { (void)parse(hostile); }), 8 * 1024);
@@ -506,7 +506,7 @@ TEST(BinaryWriterTest, TextsOfEveryLengthComeBack) {
 TEST(BinaryWriterTest, RefusesNoValueAndWhatIsNestedTooDeep) {
   EXPECT_EQ(writtenAsBinary(PropertyList()), "(refused)");
   PropertyList value = PropertyList::array({});
-  for (std::size_t i = 1; i < kDeepestPropertyList; ++i) value = PropertyList::array({value});
+  for (std::size_t i = 1; i < kMaxPropertyListDepth; ++i) value = PropertyList::array({value});
   EXPECT_EQ(parse(writtenAsBinary(value)), value);
   value = PropertyList::array({value});
   EXPECT_FALSE(serializePropertyList(value, PropertyListFormat::binary));

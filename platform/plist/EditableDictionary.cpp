@@ -53,7 +53,7 @@ void shiftReferences(std::string& objects, std::span<const std::uint32_t> offset
 
 // The dictionary is one more level around the value.
 bool isTooDeep(const ObjectWriter& value) noexcept {
-  return value.measure().height + 1 > kDeepestPropertyList;
+  return value.measure().height + 1 > kMaxPropertyListDepth;
 }
 
 }  // namespace

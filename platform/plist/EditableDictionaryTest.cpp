@@ -161,7 +161,7 @@ TEST(EditableDictionaryTest, AValueIsRefusedThatWouldMakeTheDomainUnreadable) {
   EditableDictionary edited;
   ASSERT_EQ(edited.set("stays", PropertyList::string("here")), EditableDictionary::Change::made);
   PropertyList deep = PropertyList::integer(1);
-  for (std::size_t i = 0; i < kDeepestPropertyList - 1; ++i) deep = PropertyList::array({deep});
+  for (std::size_t i = 0; i < kMaxPropertyListDepth - 1; ++i) deep = PropertyList::array({deep});
   EXPECT_EQ(edited.set("deep", deep), EditableDictionary::Change::made);
   EXPECT_TRUE(written(edited)) << "just as deep as can be read";
   EXPECT_EQ(edited.set("deeper", PropertyList::array({deep})), EditableDictionary::Change::refused);
@@ -178,7 +178,7 @@ TEST(EditableDictionaryTest, AnEmptyContainerIsALevelToo) {
   for (const PropertyList& empty : {PropertyList::array({}), PropertyList::dictionary({})}) {
     EditableDictionary edited;
     PropertyList deep = empty;
-    for (std::size_t i = 1; i < kDeepestPropertyList - 1; ++i) deep = PropertyList::array({deep});
+    for (std::size_t i = 1; i < kMaxPropertyListDepth - 1; ++i) deep = PropertyList::array({deep});
     EXPECT_EQ(edited.set("deep", deep), EditableDictionary::Change::made);
     EXPECT_TRUE(written(edited)) << "just as deep as can be read";
     EXPECT_EQ(edited.set("deeper", PropertyList::array({deep})), EditableDictionary::Change::refused);

@@ -12,7 +12,7 @@
 namespace brenvik {
 
 // Limits of every reader; a document beyond one of them is refused as malformed, in bounded time and memory.
-inline constexpr std::size_t kDeepestPropertyList = 512;               // nesting levels
+inline constexpr std::size_t kMaxPropertyListDepth = 512;               // nesting levels
 inline constexpr std::size_t kLargestXmlForm = std::size_t{64} << 20;  // bytes a document may have as XML
 
 enum class PropertyListFormat { xml, binary };

@@ -495,14 +495,14 @@ TEST(XmlReaderTest, TakesTheDeepestDocumentAllowedAndNoneThatIsDeeper) {
     for (std::size_t i = 0; i < levels; ++i) document += "</array>";
     return parse(document + "</plist>");
   };
-  const PropertyList deepest = nested(kDeepestPropertyList);
+  const PropertyList deepest = nested(kMaxPropertyListDepth);
   ASSERT_TRUE(deepest);
   for (const PropertyListFormat format : {PropertyListFormat::xml, PropertyListFormat::binary}) {
     const auto written = serializePropertyList(deepest, format);
     ASSERT_TRUE(written);
     EXPECT_EQ(parse(*written), deepest);
   }
-  EXPECT_FALSE(nested(kDeepestPropertyList + 1));
+  EXPECT_FALSE(nested(kMaxPropertyListDepth + 1));
   EXPECT_FALSE(nested(100000));
   std::string unclosed = "<plist>";
   for (int i = 0; i < 100000; ++i) unclosed += "<dict><key>k</key>";

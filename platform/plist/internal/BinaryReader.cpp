@@ -227,7 +227,7 @@ bool Reader::beginContainer(std::size_t object, const ObjectHead& head, const un
   }
   // Every reference is at least eight bytes of the document as XML.
   references_ += references;
-  if (frames_.size() == kDeepestPropertyList || references_ > kLargestXmlForm / 8) return false;
+  if (frames_.size() == kMaxPropertyListDepth || references_ > kLargestXmlForm / 8) return false;
   const std::size_t room = isDictionary ? dictionaryBytes(count) : count * sizeof(Node);
   auto* const children = static_cast<Node*>(document_->allocate(room));
   node.tag = Tag::pending;
@@ -306,7 +306,7 @@ bool Reader::addToFrame(Slot& slot) {
   Frame& frame = frames_.back();
   Node& node = slot.node;
   frame.measure.addChild(measureOf(slot));
-  if (frames_.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
+  if (frames_.size() - 1 + frame.measure.height > kMaxPropertyListDepth) return false;
   const std::size_t entries = frame.count / 2;
   if (!frame.isDictionary) {
     frame.children[frame.next] = node;

@@ -89,7 +89,7 @@ std::uint32_t ObjectWriter::add(const Node& node, std::uint32_t hash) {
 bool ObjectWriter::enter(const Node& container) {
   const std::size_t count = container.childCount();
   // Every reference is at least eight bytes of the document as XML.
-  if (frames_.size() == kDeepestPropertyList || references_.size() + count > kLargestXmlForm / 8)
+  if (frames_.size() == kMaxPropertyListDepth || references_.size() + count > kLargestXmlForm / 8)
     return false;
   const auto object = static_cast<std::uint32_t>(objects_.size() - 1);
   objects_[object].references = static_cast<std::uint32_t>(references_.size());
@@ -116,7 +116,7 @@ bool ObjectWriter::step() {
   const std::uint32_t object = add(child, hashOfChild(child, inDictionary && frame.next % 2 == 0));
   if (isFull(child) && object == before) return enter(child);
   frame.measure.addChild(isFull(child) ? done_[objects_[object].done] : leafMeasure(child));
-  if (frames_.size() - 1 + frame.measure.height > kDeepestPropertyList) return false;
+  if (frames_.size() - 1 + frame.measure.height > kMaxPropertyListDepth) return false;
   std::size_t slot = frame.next;
   if (inDictionary) slot = frame.next / 2 + (frame.next % 2 == 0 ? 0 : frame.count / 2);
   references_[references + slot] = object;

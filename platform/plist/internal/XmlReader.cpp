@@ -220,7 +220,7 @@ bool Reader::scalar(Element element) {
 
 bool Reader::beginContainer(bool isDictionary) {
   const TagEnd end = in_.tagEnd();
-  if (end == TagEnd::malformed || frames_.size() == kDeepestPropertyList) return false;
+  if (end == TagEnd::malformed || frames_.size() == kMaxPropertyListDepth) return false;
   frames_.push_back({nodes_.size(), isDictionary});
   deepest_ = std::max(deepest_, frames_.size());
   return end == TagEnd::open || endContainer();

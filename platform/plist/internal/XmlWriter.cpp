@@ -112,7 +112,7 @@ class Writer {
 
   static constexpr std::size_t kBuffer = std::size_t{32} << 10;
   // Room for an indented tag or two and a number between.
-  static constexpr std::size_t kElementRoom = kDeepestPropertyList + 96;
+  static constexpr std::size_t kElementRoom = kMaxPropertyListDepth + 96;
   // Text is escaped in pieces, so that one check of the room does for a piece.
   static constexpr std::size_t kPiece = 2048;
 
@@ -280,7 +280,7 @@ std::optional<std::string> Writer::write(const Node& root) {
   put(kXmlHead);
   const Node* value = &resolved(root);
   while (!failed_) {
-    if (value->isContainer() && frames.size() == kDeepestPropertyList) return std::nullopt;
+    if (value->isContainer() && frames.size() == kMaxPropertyListDepth) return std::nullopt;
     if (value->isContainer() && value->size != 0) {
       const bool isDictionary = value->tag == Tag::dictionary;
       reserve(kElementRoom);

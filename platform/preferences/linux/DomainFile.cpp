@@ -34,7 +34,7 @@ constexpr const char kTemporaryName[] = ".brenvik-preferences.tmp";
 constexpr std::int64_t kSettlingTime = 50'000'000;  // ns
 // How often a file is read again that changed while it was read.
 constexpr int kReadAttempts = 3;
-constexpr int kMostMovedAside = 1000;
+constexpr int kMaxMovedAside = 1000;
 
 std::int64_t nanoseconds(const timespec& time) noexcept {
   return std::int64_t{time.tv_sec} * 1'000'000'000 + time.tv_nsec;
@@ -285,7 +285,7 @@ bool DomainFile::replace(int folder, std::span<const std::string_view> content, 
 bool DomainFile::moveAside(int folder, const Attempt& attempt) const {
   const char* const reason = attempt.error != 0 ? describeError(attempt.error) : attempt.damage;
   int error = 0;
-  for (int number = 1; number <= kMostMovedAside; ++number) {
+  for (int number = 1; number <= kMaxMovedAside; ++number) {
     const std::string suffix = ".damaged-" + std::to_string(number);
     // A long name is cut, so that it fits with the suffix.
     const std::string name = place_.name.substr(0, NAME_MAX - suffix.size()) + suffix;

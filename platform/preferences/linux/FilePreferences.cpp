@@ -28,8 +28,8 @@ namespace brenvik {
 namespace {
 
 // Clients name domains freely; each that is kept costs its content and one descriptor.
-constexpr std::size_t kMostDomains = 16;
-constexpr std::size_t kMostKeptBytes = std::size_t{16} << 20;
+constexpr std::size_t kMaxDomains = 16;
+constexpr std::size_t kMaxKeptBytes = std::size_t{16} << 20;
 
 std::string homeOfEffectiveUser(int* failure) {
   std::vector<char> buffer(1024);
@@ -61,6 +61,17 @@ std::string machineId(int* failure) {
   if (!id.empty() && id.back() == '\n') id.pop_back();
   const bool isId = id.size() == 32 && id.find_first_not_of("0123456789abcdef") == std::string::npos;
   return isId ? id : std::string();
+}
+
+// Runs the work of a store; a lack of memory passes on, logged.
+template <typename Work>
+bool loggingLackOfMemory(Work work) {
+  try {
+    return work();
+  } catch (const std::bad_alloc&) {
+    logUnified(LogLevel::error, "Preferences: no memory to store a domain");
+    throw;
+  }
 }
 
 void keepKnown(std::string& known, std::string& found) noexcept {
@@ -279,69 +290,55 @@ std::shared_ptr<FilePreferences::Domain> FilePreferences::find(std::string_view 
     const auto weight = one->use_count() > 1 ? std::nullopt : (*one)->weight();
     ++count;
     bytes += weight.value_or(0);
-    one = weight && (count >= kMostDomains || bytes > kMostKeptBytes) ? domains_.erase(one) : std::next(one);
+    one = weight && (count >= kMaxDomains || bytes > kMaxKeptBytes) ? domains_.erase(one) : std::next(one);
   }
   domains_.push_front(std::make_shared<Domain>(std::move(*place), std::string(domain),
                                                PreferencesScope{user, host}, patience_));
   return domains_.front();
 }
 
-bool FilePreferences::setValue(std::string_view key, const PropertyList& value, std::string_view domain,
-                               UserScope user, HostScope host) noexcept {
+void FilePreferences::setValue(std::string_view key, const PropertyList& value, std::string_view domain,
+                               UserScope user, HostScope host) {
   try {
     if (const auto found = find(domain, user, host)) {
       found->setValue(key, value);
     } else {
       logNothingStored(domain, user, host);
     }
-    return true;
   } catch (const std::bad_alloc&) {
     logUnified(LogLevel::error, "Preferences: no memory to set a value");
-    return false;
+    throw;
   }
 }
 
-Synchronized FilePreferences::synchronize(std::string_view domain, UserScope user, HostScope host) noexcept {
-  try {
+bool FilePreferences::synchronize(std::string_view domain, UserScope user, HostScope host) {
+  return loggingLackOfMemory([&] {
     const auto found = find(domain, user, host);
-    return found != nullptr && found->synchronize() ? Synchronized::whole() : Synchronized::notWhole();
-  } catch (const std::bad_alloc&) {
-    logUnified(LogLevel::error, "Preferences: no memory to store a domain");
-    return Synchronized::withoutMemory();
-  }
+    return found != nullptr && found->synchronize();
+  });
 }
 
-bool FilePreferences::readValue(std::string_view key, std::string_view domain, UserScope user, HostScope host,
-                                PropertyList* value) noexcept {
-  try {
-    const auto found = find(domain, user, host);
-    *value = found != nullptr ? found->copyValue(key) : PropertyList();
-    return true;
-  } catch (const std::bad_alloc&) {
-    return false;
-  }
+PropertyList FilePreferences::copyValue(std::string_view key, std::string_view domain, UserScope user,
+                                        HostScope host) {
+  const auto found = find(domain, user, host);
+  return found != nullptr ? found->copyValue(key) : PropertyList();
 }
 
-Synchronized FilePreferences::synchronizeApplication(std::string_view domain) noexcept {
-  bool isWhole = namesPreferencesFile(domain);
-  try {
+bool FilePreferences::synchronizeApplication(std::string_view domain) {
+  return loggingLackOfMemory([&] {
+    bool isWhole = namesPreferencesFile(domain);
     for (const auto [user, host] : kApplicationScopes) {
       if (const auto found = find(domain, user, host)) isWhole = found->synchronize() && isWhole;
     }
-  } catch (const std::bad_alloc&) {
-    logUnified(LogLevel::error, "Preferences: no memory to store a domain");
-    return Synchronized::withoutMemory();
-  }
-  return isWhole ? Synchronized::whole() : Synchronized::notWhole();
+    return isWhole;
+  });
 }
 
-bool FilePreferences::readApplicationValue(std::string_view key, std::string_view domain,
-                                           PropertyList* value) noexcept {
+PropertyList FilePreferences::copyApplicationValue(std::string_view key, std::string_view domain) {
   for (const auto [user, host] : kApplicationScopes) {
-    if (!readValue(key, domain, user, host, value)) return false;
-    if (*value) return true;
+    if (PropertyList value = copyValue(key, domain, user, host)) return value;
   }
-  return true;
+  return {};
 }
 
 void FilePreferences::flushCachesForAnyUser(const std::string* domain) noexcept {

@@ -261,7 +261,7 @@ TEST_F(FilePreferencesTest, WhatStandsInAFileOfOursIsNotWrittenAgainAndInAForeig
 
 TEST_F(FilePreferencesTest, AValueTooDeepToBeReadAgainIsNotStoredAndSaidSoAndTheOthersAre) {
   PropertyList deep = PropertyList::integer(1);
-  for (std::size_t level = 0; level < kDeepestPropertyList; ++level) deep = PropertyList::array({deep});
+  for (std::size_t level = 0; level < kMaxPropertyListDepth; ++level) deep = PropertyList::array({deep});
   set(*ours, "good", "stored");
   ours->setValue("deep", deep, kDomain, kUser, kHost);
   EXPECT_FALSE(sync(*ours));
