@@ -122,46 +122,67 @@ bool sameScalar(const Node& one, const Node& other) noexcept {
 
 enum class Answer { equal, different, tooManySteps };
 
-// With `classes` in time linear in the nodes stored. Without, faster for a tree, but never more than
-// `allowed` children compared.
-Answer compare(const Node& left, const Node& right, EqualClasses* classes, std::size_t allowed) {
+// Compares two values, a container at a time. With `classes` in time linear in the nodes stored. Without,
+// faster for a tree, but never more than `allowed` children compared.
+class Comparison {
+ public:
+  Comparison(EqualClasses* classes, std::size_t allowed) : classes_(classes), allowed_(allowed) {}
+
+  Answer compare(const Node& left, const Node& right) {
+    if (!enter(left, right)) return Answer::different;
+    while (!open_.empty()) {
+      const auto [one, other] = open_.back();
+      open_.pop_back();
+      if (classes_ == nullptr) {
+        if (allowed_ < one->size) return Answer::tooManySteps;
+        allowed_ -= one->size;
+      }
+      if (!(one->tag == Tag::array ? enterElements(*one, *other) : enterEntries(*one, *other))) {
+        return Answer::different;
+      }
+    }
+    return Answer::equal;
+  }
+
+ private:
   struct Pair {
     const Node* left;
     const Node* right;
   };
-  std::vector<Pair> open;
+
   // Compares all but the children of containers, which it puts off.
-  auto enter = [&](const Node& leftNode, const Node& rightNode) {
-    const Node& one = plist::resolved(leftNode);
-    const Node& other = plist::resolved(rightNode);
+  bool enter(const Node& left, const Node& right) {
+    const Node& one = plist::resolved(left);
+    const Node& other = plist::resolved(right);
     if (one.tag != other.tag) return false;
     if (!one.isContainer()) return sameScalar(one, other);
     if (one.size != other.size) return false;
     if (one.children == other.children) return true;
-    if (classes == nullptr || classes->merge(one.children, other.children)) open.push_back({&one, &other});
+    if (classes_ == nullptr || classes_->merge(one.children, other.children)) open_.push_back({&one, &other});
     return true;
-  };
-  if (!enter(left, right)) return Answer::different;
-  while (!open.empty()) {
-    const auto [one, other] = open.back();
-    open.pop_back();
-    if (classes == nullptr) {
-      if (allowed < one->size) return Answer::tooManySteps;
-      allowed -= one->size;
-    }
-    for (std::size_t i = 0; i < one->size; ++i) {
-      if (one->tag == Tag::array) {
-        if (!enter(one->children[i], other->children[i])) return Answer::different;
-        continue;
-      }
-      const Node& key = one->children[2 * i];
-      const Node* match = other->children + 2 * i;
-      if (!plist::sameKey(key, *match)) match = plist::findKey(*other, key);
-      if (match == nullptr || !enter(one->children[2 * i + 1], match[1])) return Answer::different;
-    }
   }
-  return Answer::equal;
-}
+
+  bool enterElements(const Node& one, const Node& other) {
+    for (std::size_t i = 0; i < one.size; ++i) {
+      if (!enter(one.children[i], other.children[i])) return false;
+    }
+    return true;
+  }
+
+  bool enterEntries(const Node& one, const Node& other) {
+    for (std::size_t i = 0; i < one.size; ++i) {
+      const Node& key = one.children[2 * i];
+      const Node* match = other.children + 2 * i;
+      if (!plist::sameKey(key, *match)) match = plist::findKey(other, key);
+      if (match == nullptr || !enter(one.children[2 * i + 1], match[1])) return false;
+    }
+    return true;
+  }
+
+  EqualClasses* const classes_;
+  std::size_t allowed_;
+  std::vector<Pair> open_;
+};
 
 }  // namespace
 
@@ -400,10 +421,10 @@ bool PropertyList::operator==(const PropertyList& other) const noexcept {
   try {
     // Nearly every comparison ends here, without the cost of keeping classes.
     constexpr std::size_t kStepsWithoutMemory = 1 << 16;
-    Answer answer = compare(node_, other.node_, nullptr, kStepsWithoutMemory);
+    Answer answer = Comparison(nullptr, kStepsWithoutMemory).compare(node_, other.node_);
     if (answer == Answer::tooManySteps) {
       EqualClasses classes;
-      answer = compare(node_, other.node_, &classes, 0);
+      answer = Comparison(&classes, 0).compare(node_, other.node_);
     }
     return answer == Answer::equal;
   } catch (const std::bad_alloc&) {

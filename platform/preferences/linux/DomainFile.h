@@ -94,8 +94,19 @@ class DomainFile {
     Loaded loaded;
     const char* damage = nullptr;  // what is wrong with the file, if anything
     int error = 0;                 // and the errno that says so, or 0
+
+    // The file is not to blame.
+    void fail(int why) noexcept {
+      loaded.state = State::unavailable;
+      error = why;
+    }
+    void damaged(const char* what, int why = 0) noexcept {
+      fail(why);
+      damage = what;
+    }
   };
   Attempt tryLoad() const;
+  static void readContent(Attempt& attempt, std::string& bytes);
   bool moveAside(int folder, const Attempt& attempt) const;
   bool fail(const char* call, int error) const noexcept;
 
