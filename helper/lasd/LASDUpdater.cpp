@@ -49,12 +49,8 @@ class HeldToken {
 
 // A value taken out of a document keeps all of that document; this one has its own memory.
 PropertyList ownCopy(const PropertyList& value) {
-  CodecFailure failure{};
-  const auto bytes = serializePropertyList(value, PropertyListFormat::binary, &failure);
-  PropertyList copy;
-  if (bytes) copy = parsePropertyList(std::as_bytes(std::span(*bytes)), &failure);
-  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
-  return copy ? copy : value;
+  const auto bytes = serializePropertyList(value, PropertyListFormat::binary);
+  return bytes ? parsePropertyList(std::as_bytes(std::span(*bytes))) : value;
 }
 
 void giveUp(std::int32_t type) noexcept {
@@ -178,9 +174,7 @@ std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource 
     logUnified(LogLevel::error, "Could not fetch data from source %s", source.c_str());
     return kNotFetched;
   }
-  CodecFailure failure{};
-  const PropertyList manifest = onlyDictionary(parsePropertyList(fetcher.bodyAsData(), &failure));
-  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
+  const PropertyList manifest = onlyDictionary(parsePropertyList(fetcher.bodyAsData()));
   if (!manifest) {
     // Told apart from a failed fetch on purpose: the caller takes it for "nothing to do".
     logUnified(LogLevel::error, "Could not create version dictionary from downloaded plist!");

@@ -66,9 +66,7 @@ int readWhole(int file, std::string& bytes) noexcept {
 
 // What is wrong with a domain's file, or null and its content.
 const char* parse(std::string_view bytes, EditableDictionary& values) {
-  CodecFailure failure{};
-  const PropertyList document = parsePropertyList(std::as_bytes(std::span(bytes)), &failure);
-  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
+  const PropertyList document = parsePropertyList(std::as_bytes(std::span(bytes)));
   if (!document) return "not a property list";
   if (!document.is(PropertyList::Type::dictionary)) return "not a dictionary";
   auto found = EditableDictionary::of(document);
