@@ -3,6 +3,7 @@
 #include "client/EventText.h"
 
 #include <cstring>
+#include <new>
 
 #include "platform/base/Utf8.h"
 #include "platform/plist/PropertyListCodec.h"
@@ -25,7 +26,7 @@ std::string_view cutToFit(std::string_view text, std::size_t capacity) noexcept 
 }  // namespace
 
 std::ptrdiff_t textOfBinaryDictionary(std::span<const std::byte> document, std::string_view key,
-                                      std::span<char> buffer) noexcept {
+                                      std::span<char> buffer) noexcept try {
   if (!buffer.empty()) buffer[0] = '\0';
   if (document.size() < kBinaryMagic.size() ||
       std::memcmp(document.data(), kBinaryMagic.data(), kBinaryMagic.size()) != 0) {
@@ -40,6 +41,8 @@ std::ptrdiff_t textOfBinaryDictionary(std::span<const std::byte> document, std::
     buffer[shown.size()] = '\0';
   }
   return static_cast<std::ptrdiff_t>(text->size());
+} catch (const std::bad_alloc&) {
+  return -1;
 }
 
 }  // namespace brenvik::client

@@ -5,6 +5,7 @@
 #include <cstring>
 #include <memory>
 #include <new>
+#include <span>
 #include <string>
 #include <utility>
 #include <vector>
@@ -38,24 +39,27 @@ constexpr std::size_t kMinTidied = 64;
 
 using Type = PropertyList::Type;
 
-// The value as it is now; absent when memory runs out.
-PropertyList current(const bvmh_value* handle) noexcept {
-  if (handle == nullptr) return {};
-  if (!handle->isChanged) return handle->value;
-  return handle->value.is(Type::array) ? PropertyList::array(handle->elements)
-                                       : PropertyList::dictionary(handle->entries);
+// Nothing is thrown at a C program: runs the work, and returns `onExhaustion` when memory runs out in it.
+template <class Result, class Work>
+Result guarded(Result onExhaustion, const Work& work) noexcept {
+  try {
+    return work();
+  } catch (const std::bad_alloc&) {
+    return onExhaustion;
+  }
 }
 
 // Makes what was changed a property list again. False when memory runs out; then it is as it was.
 bool settle(bvmh_value* handle) noexcept {
   if (!handle->isChanged) return true;
-  PropertyList made = current(handle);
-  if (!made) return false;
-  handle->value = std::move(made);
-  handle->isChanged = false;
-  handle->elements.clear();
-  handle->entries.clear();
-  return true;
+  return guarded(false, [handle] {
+    handle->value = handle->value.is(Type::array) ? PropertyList::array(handle->elements)
+                                                  : PropertyList::dictionary(handle->entries);
+    handle->isChanged = false;
+    handle->elements.clear();
+    handle->entries.clear();
+    return true;
+  });
 }
 
 // For functions that only read: that the handle keeps its value in another form is nobody's concern.
@@ -67,6 +71,9 @@ const PropertyList& settled(const bvmh_value* handle) noexcept {
 bvmh_value* handleOf(PropertyList value) noexcept {
   return value ? new (std::nothrow) bvmh_value(std::move(value)) : nullptr;
 }
+
+constexpr bvmh_value* kNoHandle = nullptr;
+constexpr const char* kNoText = nullptr;
 
 bool isContainer(const bvmh_value* handle, Type type) noexcept {
   return handle != nullptr && handle->value.is(type);
@@ -126,12 +133,14 @@ bvmh_value* bvmh_value_new_array(void) { return handleOf(PropertyList::array({})
 bvmh_value* bvmh_value_new_dictionary(void) { return handleOf(PropertyList::dictionary({})); }
 
 bvmh_value* bvmh_value_new_text(const char* text) {
-  return text == nullptr ? nullptr : handleOf(PropertyList::string(text));
+  if (text == nullptr) return nullptr;
+  return guarded(kNoHandle, [text] { return handleOf(PropertyList::string(text)); });
 }
 
 bvmh_value* bvmh_value_new_data(const void* bytes, size_t size) {
   if (bytes == nullptr && size != 0) return nullptr;
-  return handleOf(PropertyList::data({static_cast<const std::byte*>(bytes), size}));
+  const std::span data(static_cast<const std::byte*>(bytes), size);
+  return guarded(kNoHandle, [data] { return handleOf(PropertyList::data(data)); });
 }
 
 bvmh_value* bvmh_value_copy(const bvmh_value* value) { return handleOf(settled(value)); }
@@ -150,9 +159,8 @@ int32_t bvmh_value_set(bvmh_value* dictionary, const char* key, bvmh_value* valu
   if (value == nullptr || value == dictionary) return BVMH_ERROR_INVALID_ARGUMENT;
   const std::unique_ptr<bvmh_value> owned(value);
   if (!isContainer(dictionary, Type::dictionary) || key == nullptr) return BVMH_ERROR_INVALID_ARGUMENT;
-  const PropertyList asText = PropertyList::string(key);
   if (!settle(value)) return BVMH_ERROR_NO_MEMORY;
-  if (!asText) return brenvik::isValidUtf8(key) ? BVMH_ERROR_NO_MEMORY : BVMH_ERROR_INVALID_ARGUMENT;
+  if (!brenvik::isValidUtf8(key)) return BVMH_ERROR_INVALID_ARGUMENT;
   if (dictionary->isChanged && dictionary->entries.size() >= dictionary->tidyAt && !settle(dictionary))
     return BVMH_ERROR_NO_MEMORY;
   return change(*dictionary, [&] { dictionary->entries.emplace_back(key, value->value); });
@@ -190,12 +198,10 @@ bvmh_value* bvmh_value_at(const bvmh_value* value, size_t index) {
 const char* bvmh_value_key_at(bvmh_value* dictionary, size_t index) {
   const PropertyList& value = settled(dictionary);
   if (!value.is(Type::dictionary) || index >= value.size()) return nullptr;
-  try {
+  return guarded(kNoText, [&] {
     dictionary->text = value.keyAt(index);
-  } catch (const std::bad_alloc&) {
-    return nullptr;
-  }
-  return dictionary->text.c_str();
+    return dictionary->text.c_str();
+  });
 }
 
 bvmh_value* bvmh_value_find(const bvmh_value* dictionary, const char* key) {
@@ -226,13 +232,11 @@ const char* bvmh_value_get_text(bvmh_value* value, size_t* length) {
   if (length != nullptr) *length = 0;
   const auto found = settled(value).asString();
   if (!found) return nullptr;
-  try {
+  return guarded(kNoText, [&] {
     value->text = *found;
-  } catch (const std::bad_alloc&) {
-    return nullptr;
-  }
-  if (length != nullptr) *length = value->text.size();
-  return value->text.c_str();
+    if (length != nullptr) *length = value->text.size();
+    return value->text.c_str();
+  });
 }
 
 const void* bvmh_value_get_data(const bvmh_value* value, size_t* size) {
@@ -248,11 +252,13 @@ int32_t bvmh_value_read(const void* bytes, size_t size, bvmh_value** value) {
   if (value == nullptr) return BVMH_ERROR_INVALID_ARGUMENT;
   *value = nullptr;
   if (bytes == nullptr && size != 0) return BVMH_ERROR_INVALID_ARGUMENT;
-  brenvik::CodecFailure why{};
-  PropertyList read = parsePropertyList({static_cast<const std::byte*>(bytes), size}, &why);
-  if (!read) return why == brenvik::CodecFailure::noMemory ? BVMH_ERROR_NO_MEMORY : BVMH_ERROR_NOT_A_VALUE;
-  *value = handleOf(std::move(read));
-  return *value == nullptr ? BVMH_ERROR_NO_MEMORY : BVMH_OK;
+  const std::span document(static_cast<const std::byte*>(bytes), size);
+  return guarded<std::int32_t>(BVMH_ERROR_NO_MEMORY, [&] {
+    PropertyList read = brenvik::parsePropertyList(document);
+    if (!read) return BVMH_ERROR_NOT_A_VALUE;
+    *value = handleOf(std::move(read));
+    return *value == nullptr ? BVMH_ERROR_NO_MEMORY : BVMH_OK;
+  });
 }
 
 int32_t bvmh_value_write(const bvmh_value* value, bvmh_region* bytes) {
@@ -261,14 +267,15 @@ int32_t bvmh_value_write(const bvmh_value* value, bvmh_region* bytes) {
   if (value == nullptr) return BVMH_ERROR_INVALID_ARGUMENT;
   const PropertyList& written = settled(value);
   if (!written) return BVMH_ERROR_NO_MEMORY;
-  brenvik::CodecFailure why{};
-  const auto made = serializePropertyList(written, brenvik::PropertyListFormat::binary, &why);
-  if (!made) return why == brenvik::CodecFailure::noMemory ? BVMH_ERROR_NO_MEMORY : BVMH_ERROR_NOT_A_VALUE;
-  void* copy = std::malloc(made->size());
-  if (copy == nullptr) return BVMH_ERROR_NO_MEMORY;
-  std::memcpy(copy, made->data(), made->size());
-  *bytes = {copy, made->size(), copy, nullptr};
-  return BVMH_OK;
+  return guarded<std::int32_t>(BVMH_ERROR_NO_MEMORY, [&] {
+    const auto made = serializePropertyList(written, brenvik::PropertyListFormat::binary);
+    if (!made) return BVMH_ERROR_NOT_A_VALUE;
+    void* copy = std::malloc(made->size());
+    if (copy == nullptr) return BVMH_ERROR_NO_MEMORY;
+    std::memcpy(copy, made->data(), made->size());
+    *bytes = {copy, made->size(), copy, nullptr};
+    return BVMH_OK;
+  });
 }
 
 }  // extern "C"

@@ -4,6 +4,8 @@
 # One folder, one static library. Each library shows its consumers a view of its own headers only (links in
 # the build tree, under the path they have in the source tree), so an include of a folder that is not
 # among a target's dependencies does not build. That is what keeps the arrows pointing one way.
+#
+# A folder's subfolder "internal" belongs to the same library: only the library's own sources see its headers.
 
 find_package(Threads REQUIRED)
 if(NOT BRENVIK_CLIENT_ONLY)
@@ -25,26 +27,37 @@ if(BUILD_TESTING)
     <thread> <vector>)
 endif()
 
-# brenvik_library(<target> [DEPENDS <what its headers use>...] [PRIVATE <what only its sources use>...])
-# Takes every .cpp of the folder but *Test.cpp, *Fuzz.cpp and main.cpp; a folder of headers only becomes an
-# INTERFACE library.
-function(brenvik_library target)
-  cmake_parse_arguments(ARG "" "" "DEPENDS;PRIVATE;SOURCES" ${ARGN})
-  file(GLOB sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*.cpp)
-  list(FILTER sources EXCLUDE REGEX "/([A-Za-z0-9]*(Test|Fuzz)|main)\\.cpp$")
-  list(APPEND sources ${ARG_SOURCES})
-  file(GLOB headers CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*.h)
-  file(RELATIVE_PATH folder ${PROJECT_SOURCE_DIR} ${CMAKE_CURRENT_SOURCE_DIR})
-  set(view ${PROJECT_BINARY_DIR}/views/${target})
+# brenvik_view(<view> <folder>)
+# Makes the view anew: links to the headers of the folder, which is named from the root of the source tree.
+function(brenvik_view view folder)
+  file(GLOB headers CONFIGURE_DEPENDS ${PROJECT_SOURCE_DIR}/${folder}/*.h)
   file(REMOVE_RECURSE ${view})
   file(MAKE_DIRECTORY ${view}/${folder})
   foreach(header IN LISTS headers)
     get_filename_component(name ${header} NAME)
     file(CREATE_LINK ${header} ${view}/${folder}/${name} SYMBOLIC)
   endforeach()
+endfunction()
+
+# brenvik_library(<target> [DEPENDS <what its headers use>...] [PRIVATE <what only its sources use>...])
+# Takes every .cpp of the folder but *Test.cpp, *Fuzz.cpp and main.cpp; a folder of headers only becomes an
+# INTERFACE library.
+function(brenvik_library target)
+  cmake_parse_arguments(ARG "" "" "DEPENDS;PRIVATE;SOURCES" ${ARGN})
+  file(GLOB sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*.cpp ${CMAKE_CURRENT_SOURCE_DIR}/internal/*.cpp)
+  list(FILTER sources EXCLUDE REGEX "/([A-Za-z0-9]*(Test|Fuzz)|main)\\.cpp$")
+  list(APPEND sources ${ARG_SOURCES})
+  file(RELATIVE_PATH folder ${PROJECT_SOURCE_DIR} ${CMAKE_CURRENT_SOURCE_DIR})
+  set(view ${PROJECT_BINARY_DIR}/views/${target})
+  set(internal_view "")
+  brenvik_view(${view} ${folder})
+  if(IS_DIRECTORY ${CMAKE_CURRENT_SOURCE_DIR}/internal)
+    set(internal_view ${view}.internal)
+    brenvik_view(${internal_view} ${folder}/internal)
+  endif()
   if(sources)
     add_library(${target} STATIC ${sources})
-    target_include_directories(${target} PUBLIC ${view})
+    target_include_directories(${target} PUBLIC ${view} PRIVATE ${internal_view})
     target_link_libraries(${target} PUBLIC ${ARG_DEPENDS} PRIVATE brenvik_flags ${ARG_PRIVATE})
   else()
     add_library(${target} INTERFACE)

@@ -30,20 +30,11 @@ class FlushRecorder final : public PreferencesStore {
  public:
   std::vector<std::optional<std::string>> flushed;
 
-  bool setValue(std::string_view, const PropertyList&, std::string_view, UserScope,
-                HostScope) noexcept override {
-    return true;
-  }
-  Synchronized synchronize(std::string_view, UserScope, HostScope) noexcept override {
-    return Synchronized::whole();
-  }
-  bool readValue(std::string_view, std::string_view, UserScope, HostScope, PropertyList*) noexcept override {
-    return true;
-  }
-  Synchronized synchronizeApplication(std::string_view) noexcept override { return Synchronized::whole(); }
-  bool readApplicationValue(std::string_view, std::string_view, PropertyList*) noexcept override {
-    return true;
-  }
+  void setValue(std::string_view, const PropertyList&, std::string_view, UserScope, HostScope) override {}
+  bool synchronize(std::string_view, UserScope, HostScope) override { return true; }
+  PropertyList copyValue(std::string_view, std::string_view, UserScope, HostScope) override { return {}; }
+  bool synchronizeApplication(std::string_view) override { return true; }
+  PropertyList copyApplicationValue(std::string_view, std::string_view) override { return {}; }
   void flushCachesForAnyUser(const std::string* domain) noexcept override {
     flushed.push_back(domain == nullptr ? std::nullopt : std::optional(*domain));
   }

@@ -316,8 +316,10 @@ std::string FileSystemManager::readLink(const std::string& path) noexcept {
 PropertyList FileSystemManager::readDictionary(const std::string& path) noexcept {
   const std::optional<std::string> bytes = readData(path);
   if (!bytes) return {};
-  PropertyList value = parsePropertyList(std::as_bytes(std::span(*bytes)));
-  return value.is(PropertyList::Type::dictionary) ? value : PropertyList();
+  return guarded(PropertyList(), [&] {
+    PropertyList value = parsePropertyList(std::as_bytes(std::span(*bytes)));
+    return value.is(PropertyList::Type::dictionary) ? value : PropertyList();
+  });
 }
 
 std::optional<std::string> FileSystemManager::readData(const std::string& path) noexcept {
@@ -327,14 +329,18 @@ std::optional<std::string> FileSystemManager::readData(const std::string& path) 
 
 bool FileSystemManager::writeDictionary(const std::string& path, const PropertyList& dictionary) noexcept {
   if (!dictionary.is(PropertyList::Type::dictionary)) return false;
-  const std::optional<std::string> bytes = serializePropertyList(dictionary, PropertyListFormat::xml);
-  return bytes && files().writeFileAtomically(path, *bytes);
+  return guarded(false, [&] {
+    const std::optional<std::string> bytes = serializePropertyList(dictionary, PropertyListFormat::xml);
+    return bytes && files().writeFileAtomically(path, *bytes);
+  });
 }
 
 bool FileSystemManager::writePropertyList(const std::string& path, const PropertyList& propertyList,
                                           PropertyListFormat format) noexcept {
-  const std::optional<std::string> bytes = serializePropertyList(propertyList, format);
-  return bytes && files().writeFile(path, *bytes);
+  return guarded(false, [&] {
+    const std::optional<std::string> bytes = serializePropertyList(propertyList, format);
+    return bytes && files().writeFile(path, *bytes);
+  });
 }
 
 bool FileSystemManager::writeData(const std::string& path, const std::string* data) noexcept {

@@ -49,7 +49,12 @@ PropertyList decodeArray(const void* bytes, std::uint32_t length, const FieldTex
     logUnified(LogLevel::error, "%s", texts.cannotDecode);
     return {};
   }
-  PropertyList value = parsePropertyList(*data);
+  PropertyList value;
+  try {
+    value = parsePropertyList(*data);
+  } catch (const std::bad_alloc&) {
+    // It cannot be built, as the line says.
+  }
   if (!value.hasValue()) {
     logUnified(LogLevel::error, "%s", texts.cannotBuild);
     return {};
@@ -61,16 +66,9 @@ PropertyList decodeArray(const void* bytes, std::uint32_t length, const FieldTex
   return value;
 }
 
-// The labeler would take no value for no labels.
-PropertyList arrayOf(const std::vector<PropertyList>& elements) {
-  PropertyList array = PropertyList::array(elements);
-  if (!array.hasValue()) throw std::bad_alloc();
-  return array;
-}
-
 // Leaves the result as XML in a fresh region. `refused` writes the line for a region that could not be had.
 KernelReturn handOver(const PropertyList& result, RegionAllocator& regions, OutOfLinePayload* payload,
-                      void (*refused)(int length)) noexcept {
+                      void (*refused)(int length)) noexcept try {
   if (!result.hasValue()) return kern::failure;
   const std::optional<std::string> xml = serializePropertyList(result, PropertyListFormat::xml);
   if (!xml.has_value() || xml->empty()) return kern::failure;
@@ -81,6 +79,8 @@ KernelReturn handOver(const PropertyList& result, RegionAllocator& regions, OutO
     *payload = {};
   }
   return code;
+} catch (const std::bad_alloc&) {
+  return kern::failure;
 }
 
 }  // namespace
@@ -147,7 +147,7 @@ PropertyList LabelRoutines::getLocalizedBadgeLabelsForUnlocalizedLabels(
     }
     logUnified(LogLevel::standard, "getLocalizedBadgeLabelsForUnlocalizedLabels, %zu label(s)",
                wanted.size());
-    return labeler_.localizedBadgeLabels(arrayOf(wanted), languages);
+    return labeler_.localizedBadgeLabels(PropertyList::array(wanted), languages);
   } catch (const std::bad_alloc&) {
     return {};
   }
@@ -169,7 +169,8 @@ PropertyList LabelRoutines::getLocalizedPredefinedLabels(const PropertyList& lab
       }
     }
     // No labels are not an error here, unlike above: the caller gets an empty array.
-    return labeler_.localizedLabels(arrayOf(wanted), languages.size() == 0 ? PropertyList() : languages);
+    return labeler_.localizedLabels(PropertyList::array(wanted),
+                                    languages.size() == 0 ? PropertyList() : languages);
   } catch (const std::bad_alloc&) {
     return {};
   }

@@ -3,7 +3,6 @@
 #include "helper/labels/LabelVocabulary.h"
 
 #include <array>
-#include <new>
 #include <utility>
 
 #include "platform/labeler/SubscriptionLabeler.h"
@@ -11,23 +10,16 @@
 namespace brenvik {
 namespace {
 
-PropertyList text(std::string_view utf8) {
-  PropertyList value = PropertyList::string(utf8);
-  // Half a table must not become the table.
-  if (!value.hasValue()) throw std::bad_alloc();
-  return value;
-}
-
 using Vocabulary = std::array<std::pair<PropertyList, PropertyList>, 6>;
 
 const Vocabulary& vocabulary() {
   static const Vocabulary table{{
-      {text("USER_LABEL_PRIMARY"), text(label_identifier::primary)},
-      {text("USER_LABEL_SECONDARY"), text(label_identifier::secondary)},
-      {text("USER_LABEL_PERSONAL"), text(label_identifier::personal)},
-      {text("USER_LABEL_BUSINESS"), text(label_identifier::business)},
-      {text("USER_LABEL_TRAVEL"), text(label_identifier::travel)},
-      {text("USER_LABEL_CELL_DATA"), text(label_identifier::data)},
+      {PropertyList::string("USER_LABEL_PRIMARY"), PropertyList::string(label_identifier::primary)},
+      {PropertyList::string("USER_LABEL_SECONDARY"), PropertyList::string(label_identifier::secondary)},
+      {PropertyList::string("USER_LABEL_PERSONAL"), PropertyList::string(label_identifier::personal)},
+      {PropertyList::string("USER_LABEL_BUSINESS"), PropertyList::string(label_identifier::business)},
+      {PropertyList::string("USER_LABEL_TRAVEL"), PropertyList::string(label_identifier::travel)},
+      {PropertyList::string("USER_LABEL_CELL_DATA"), PropertyList::string(label_identifier::data)},
   }};
   return table;
 }

@@ -109,9 +109,12 @@ bool DatabaseInstaller::downloadAndInstall(const std::string& url, std::int32_t 
 bool DatabaseInstaller::recordVersion(std::int32_t type, const PropertyList& record) {
   const char* const key = keyOfDatabaseType(type);
   if (key == nullptr) return false;
-  return parts_.preferences.setValue(key, record, kVersionsDomain, UserScope::currentUser,
-                                     HostScope::anyHost) &&
-         parts_.preferences.synchronize(kVersionsDomain, UserScope::currentUser, HostScope::anyHost);
+  try {
+    parts_.preferences.setValue(key, record, kVersionsDomain, UserScope::currentUser, HostScope::anyHost);
+    return parts_.preferences.synchronize(kVersionsDomain, UserScope::currentUser, HostScope::anyHost);
+  } catch (const std::bad_alloc&) {
+    return false;  // the store has logged it
+  }
 }
 
 }  // namespace brenvik

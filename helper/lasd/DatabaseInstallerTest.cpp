@@ -294,6 +294,17 @@ TEST_F(DatabaseInstallerTest, ARecordThatCannotBeStoredFailsTheInstall) {
   EXPECT_FALSE(recorded("gsm"));
 }
 
+TEST_F(DatabaseInstallerTest, ARecordThatThereIsNoMemoryForFailsTheInstall) {
+  serveGzip(kUrl, "database");
+  for (const int operations : {0, 1}) {  // the setting, the storing
+    preferences.operationsWithMemory = operations;
+    EXPECT_FALSE(install());
+    preferences.operationsWithMemory = -1;
+    EXPECT_FALSE(recorded("gsm"));
+  }
+  EXPECT_EQ(contentOf(at("gsm.db")), "database");
+}
+
 TEST_F(DatabaseInstallerTest, EachTypeIsRecordedUnderItsName) {
   const std::pair<std::int32_t, const char*> types[] = {
       {1, "umts"}, {2, "cdma"}, {4, "lte"}, {8, "gsm"}, {16, "scdma"}};

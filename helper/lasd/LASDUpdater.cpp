@@ -49,12 +49,8 @@ class HeldToken {
 
 // A value taken out of a document keeps all of that document; this one has its own memory.
 PropertyList ownCopy(const PropertyList& value) {
-  CodecFailure failure{};
-  const auto bytes = serializePropertyList(value, PropertyListFormat::binary, &failure);
-  PropertyList copy;
-  if (bytes) copy = parsePropertyList(std::as_bytes(std::span(*bytes)), &failure);
-  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
-  return copy ? copy : value;
+  const auto bytes = serializePropertyList(value, PropertyListFormat::binary);
+  return bytes ? parsePropertyList(std::as_bytes(std::span(*bytes))) : value;
 }
 
 void giveUp(std::int32_t type) noexcept {
@@ -163,12 +159,8 @@ std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource 
     for (const std::int32_t type : kDatabaseTypesInOrder) {
       if ((mask & static_cast<std::uint32_t>(type)) == 0) continue;
       try {
-        PropertyList record;
-        if (!parts_->preferences.readValue(keyOfDatabaseType(type), source, UserScope::currentUser,
-                                           HostScope::anyHost, &record)) {
-          throw std::bad_alloc();
-        }
-        versions_[type] = onlyDictionary(std::move(record));
+        versions_[type] = onlyDictionary(parts_->preferences.copyValue(
+            keyOfDatabaseType(type), source, UserScope::currentUser, HostScope::anyHost));
       } catch (const std::bad_alloc&) {
         versions_.erase(type);  // an earlier check's entry would be taken for the present one
         outOfMemory_ |= type;
@@ -182,9 +174,7 @@ std::int64_t LASDUpdater::loadVersions(const std::string& source, VersionSource 
     logUnified(LogLevel::error, "Could not fetch data from source %s", source.c_str());
     return kNotFetched;
   }
-  CodecFailure failure{};
-  const PropertyList manifest = onlyDictionary(parsePropertyList(fetcher.bodyAsData(), &failure));
-  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
+  const PropertyList manifest = onlyDictionary(parsePropertyList(fetcher.bodyAsData()));
   if (!manifest) {
     // Told apart from a failed fetch on purpose: the caller takes it for "nothing to do".
     logUnified(LogLevel::error, "Could not create version dictionary from downloaded plist!");

@@ -31,18 +31,13 @@ const char* valueOf(NotificationKind kind) noexcept {
 }  // namespace
 
 PropertyList makeNotification(NotificationKind kind, std::int32_t type) {
-  // A dictionary leaves out what has no value: without memory there is none, rather than half of one.
   std::vector<std::pair<std::string, PropertyList>> entries;
-  const auto add = [&entries](const char* key, const char* text) {
-    PropertyList value = PropertyList::string(text);
-    if (!value) return false;
-    entries.emplace_back(key, std::move(value));
-    return true;
-  };
-  if (!add("Notification", valueOf(kind))) return {};
+  entries.emplace_back("Notification", PropertyList::string(valueOf(kind)));
   const char* const key = keyOfDatabaseType(type);
-  if (kind == NotificationKind::updateAvailable && key != nullptr && !add("DBType", key)) return {};
-  return PropertyList::dictionary(std::move(entries));
+  if (kind == NotificationKind::updateAvailable && key != nullptr) {
+    entries.emplace_back("DBType", PropertyList::string(key));
+  }
+  return PropertyList::dictionary(entries);
 }
 
 void sendNotification(MessagePorts& ports, const PropertyList& notification) {

@@ -32,7 +32,7 @@ std::optional<std::string_view> utf8In(char* field) noexcept {
 
 KernelReturn PreferenceTransfer::setPreferenceValue(PortName /*port*/, char* domain, char* key,
                                                     const void* valueBytes,
-                                                    std::uint32_t valueLength) noexcept {
+                                                    std::uint32_t valueLength) noexcept try {
   const auto domainText = utf8In(domain);
   const auto keyText = utf8In(key);
   if (!domainText || !keyText) return kern::failure;
@@ -43,13 +43,12 @@ KernelReturn PreferenceTransfer::setPreferenceValue(PortName /*port*/, char* dom
     value = parsePropertyList({static_cast<const std::byte*>(valueBytes), valueLength});
     if (!value) return kern::failure;
   }
-  if (!preferences_.setValue(*keyText, value, *domainText, UserScope::currentUser, HostScope::anyHost)) {
-    return kern::failure;
-  }
+  preferences_.setValue(*keyText, value, *domainText, UserScope::currentUser, HostScope::anyHost);
   // The status does not tell whether the disk took it; the store's own error line does.
-  const Synchronized stored =
-      preferences_.synchronize(*domainText, UserScope::currentUser, HostScope::anyHost);
-  return stored.lackedMemory() ? kern::failure : kern::success;
+  (void)preferences_.synchronize(*domainText, UserScope::currentUser, HostScope::anyHost);
+  return kern::success;
+} catch (const std::bad_alloc&) {
+  return kern::failure;
 }
 
 KernelReturn PreferenceTransfer::copyPreferenceValue(PortName /*port*/, char* domain, char* key,
@@ -63,25 +62,22 @@ KernelReturn PreferenceTransfer::copyAppPreferenceValue(PortName /*port*/, char*
 }
 
 KernelReturn PreferenceTransfer::copyValue(Scope scope, char* domain, char* key,
-                                           OutOfLinePayload* payload) noexcept {
+                                           OutOfLinePayload* payload) noexcept try {
   *payload = {};
   const auto domainText = utf8In(domain);
   const auto keyText = utf8In(key);
   if (!domainText || !keyText) return kern::failure;
 
-  // First see what other processes have written. Nothing of ours is waiting to be stored, so only a lack of
-  // memory matters here, which would leave us with what was there before: what cannot be read has no value.
+  // First see what other processes have written. Nothing of ours is waiting to be stored, so the result does
+  // not matter: what cannot be read has no value.
   PropertyList value;
-  bool isKnown = false;
   if (scope == Scope::application) {
-    isKnown = !preferences_.synchronizeApplication(*domainText).lackedMemory() &&
-              preferences_.readApplicationValue(*keyText, *domainText, &value);
+    (void)preferences_.synchronizeApplication(*domainText);
+    value = preferences_.copyApplicationValue(*keyText, *domainText);
   } else {
-    isKnown =
-        !preferences_.synchronize(*domainText, UserScope::currentUser, HostScope::anyHost).lackedMemory() &&
-        preferences_.readValue(*keyText, *domainText, UserScope::currentUser, HostScope::anyHost, &value);
+    (void)preferences_.synchronize(*domainText, UserScope::currentUser, HostScope::anyHost);
+    value = preferences_.copyValue(*keyText, *domainText, UserScope::currentUser, HostScope::anyHost);
   }
-  if (!isKnown) return kern::failure;
   if (!value) return kern::success;
 
   const auto bytes = serializePropertyList(value, PropertyListFormat::xml);
@@ -93,6 +89,8 @@ KernelReturn PreferenceTransfer::copyValue(Scope scope, char* domain, char* key,
     logBsd(SyslogPriority::error, "VM_ALLOCATE %ul (mhs1)\n", payload->length);
   }
   return code;
+} catch (const std::bad_alloc&) {
+  return kern::failure;
 }
 
 KernelReturn PreferenceTransfer::loadPlistFile(PortName /*port*/, char* path,

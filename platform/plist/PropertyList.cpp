@@ -4,11 +4,10 @@
 
 #include <cmath>
 #include <limits>
-#include <new>
 #include <unordered_map>
 
 #include "platform/base/Utf8.h"
-#include "platform/plist/Document.h"
+#include "platform/plist/internal/Document.h"
 
 namespace brenvik {
 
@@ -33,19 +32,15 @@ Node scalar(Tag tag) noexcept {
   return node;
 }
 
-PropertyList textValue(Tag tag, const char* bytes, std::size_t size) noexcept {
+PropertyList textValue(Tag tag, const char* bytes, std::size_t size) {
   if (size > kLargestCount) return {};
   Node node = scalar(tag);
   node.size = static_cast<std::uint32_t>(size);
   node.text = "";
   if (size == 0) return Access::make(node, nullptr);
-  try {
-    DocumentHolder document(size);
-    node.text = document->copyText(bytes, size);
-    return Access::make(node, document.handOver());
-  } catch (const std::bad_alloc&) {
-    return {};
-  }
+  DocumentHolder document(size);
+  node.text = document->copyText(bytes, size);
+  return Access::make(node, document.handOver());
 }
 
 bool isText(const Node& node) noexcept { return node.tag == Tag::string || node.tag == Tag::data; }
@@ -122,46 +117,67 @@ bool sameScalar(const Node& one, const Node& other) noexcept {
 
 enum class Answer { equal, different, tooManySteps };
 
-// With `classes` in time linear in the nodes stored. Without, faster for a tree, but never more than
-// `allowed` children compared.
-Answer compare(const Node& left, const Node& right, EqualClasses* classes, std::size_t allowed) {
+// Compares two values, a container at a time. With `classes` in time linear in the nodes stored. Without,
+// faster for a tree, but never more than `allowed` children compared.
+class Comparison {
+ public:
+  Comparison(EqualClasses* classes, std::size_t allowed) : classes_(classes), allowed_(allowed) {}
+
+  Answer compare(const Node& left, const Node& right) {
+    if (!enter(left, right)) return Answer::different;
+    while (!open_.empty()) {
+      const auto [one, other] = open_.back();
+      open_.pop_back();
+      if (classes_ == nullptr) {
+        if (allowed_ < one->size) return Answer::tooManySteps;
+        allowed_ -= one->size;
+      }
+      if (!(one->tag == Tag::array ? enterElements(*one, *other) : enterEntries(*one, *other))) {
+        return Answer::different;
+      }
+    }
+    return Answer::equal;
+  }
+
+ private:
   struct Pair {
     const Node* left;
     const Node* right;
   };
-  std::vector<Pair> open;
+
   // Compares all but the children of containers, which it puts off.
-  auto enter = [&](const Node& leftNode, const Node& rightNode) {
-    const Node& one = plist::resolved(leftNode);
-    const Node& other = plist::resolved(rightNode);
+  bool enter(const Node& left, const Node& right) {
+    const Node& one = plist::resolved(left);
+    const Node& other = plist::resolved(right);
     if (one.tag != other.tag) return false;
     if (!one.isContainer()) return sameScalar(one, other);
     if (one.size != other.size) return false;
     if (one.children == other.children) return true;
-    if (classes == nullptr || classes->merge(one.children, other.children)) open.push_back({&one, &other});
+    if (classes_ == nullptr || classes_->merge(one.children, other.children)) open_.push_back({&one, &other});
     return true;
-  };
-  if (!enter(left, right)) return Answer::different;
-  while (!open.empty()) {
-    const auto [one, other] = open.back();
-    open.pop_back();
-    if (classes == nullptr) {
-      if (allowed < one->size) return Answer::tooManySteps;
-      allowed -= one->size;
-    }
-    for (std::size_t i = 0; i < one->size; ++i) {
-      if (one->tag == Tag::array) {
-        if (!enter(one->children[i], other->children[i])) return Answer::different;
-        continue;
-      }
-      const Node& key = one->children[2 * i];
-      const Node* match = other->children + 2 * i;
-      if (!plist::sameKey(key, *match)) match = plist::findKey(*other, key);
-      if (match == nullptr || !enter(one->children[2 * i + 1], match[1])) return Answer::different;
-    }
   }
-  return Answer::equal;
-}
+
+  bool enterElements(const Node& one, const Node& other) {
+    for (std::size_t i = 0; i < one.size; ++i) {
+      if (!enter(one.children[i], other.children[i])) return false;
+    }
+    return true;
+  }
+
+  bool enterEntries(const Node& one, const Node& other) {
+    for (std::size_t i = 0; i < one.size; ++i) {
+      const Node& key = one.children[2 * i];
+      const Node* match = other.children + 2 * i;
+      if (!plist::sameKey(key, *match)) match = plist::findKey(other, key);
+      if (match == nullptr || !enter(one.children[2 * i + 1], match[1])) return false;
+    }
+    return true;
+  }
+
+  EqualClasses* const classes_;
+  std::size_t allowed_;
+  std::vector<Pair> open_;
+};
 
 }  // namespace
 
@@ -215,16 +231,16 @@ PropertyList PropertyList::date(double secondsSince2001) noexcept {
   return Access::make(node, nullptr);
 }
 
-PropertyList PropertyList::string(std::string_view utf8) noexcept {
+PropertyList PropertyList::string(std::string_view utf8) {
   if (!isValidUtf8(utf8)) return {};
   return textValue(Tag::string, utf8.data(), utf8.size());
 }
 
-PropertyList PropertyList::data(std::span<const std::byte> bytes) noexcept {
+PropertyList PropertyList::data(std::span<const std::byte> bytes) {
   return textValue(Tag::data, reinterpret_cast<const char*>(bytes.data()), bytes.size());
 }
 
-PropertyList PropertyList::array(const std::vector<PropertyList>& elements) noexcept {
+PropertyList PropertyList::array(const std::vector<PropertyList>& elements) {
   std::size_t count = 0;
   std::size_t room = 0;
   for (const PropertyList& element : elements) {
@@ -236,21 +252,16 @@ PropertyList PropertyList::array(const std::vector<PropertyList>& elements) noex
   Node node = scalar(Tag::array);
   node.size = static_cast<std::uint32_t>(count);
   if (count == 0) return Access::make(node, nullptr);
-  try {
-    DocumentHolder document(room);
-    auto* next = static_cast<Node*>(document->allocate(count * sizeof(Node)));
-    node.children = next;
-    for (const PropertyList& element : elements) {
-      if (element) *next++ = place(*document, element.node_, element.owner_);
-    }
-    return Access::make(node, document.handOver());
-  } catch (const std::bad_alloc&) {
-    return {};
+  DocumentHolder document(room);
+  auto* next = static_cast<Node*>(document->allocate(count * sizeof(Node)));
+  node.children = next;
+  for (const PropertyList& element : elements) {
+    if (element) *next++ = place(*document, element.node_, element.owner_);
   }
+  return Access::make(node, document.handOver());
 }
 
-PropertyList PropertyList::dictionary(
-    const std::vector<std::pair<std::string, PropertyList>>& entries) noexcept {
+PropertyList PropertyList::dictionary(const std::vector<std::pair<std::string, PropertyList>>& entries) {
   std::size_t count = 0;
   std::size_t room = 0;
   for (const auto& [key, value] : entries) {
@@ -261,25 +272,21 @@ PropertyList PropertyList::dictionary(
   }
   if (count > kLargestCount / 2) return {};
   if (count == 0) return Access::make(scalar(Tag::dictionary), nullptr);
-  try {
-    const std::size_t table = plist::dictionaryBytes(count);
-    DocumentHolder document(table + room + sizeof(Node));
-    auto* const pairs = static_cast<Node*>(document->allocate(table));
-    Node* next = pairs;
-    for (const auto& [key, value] : entries) {
-      if (!value) continue;
-      *next = keyNode(key);
-      next->text = document->copyText(key.data(), key.size());
-      next[1] = place(*document, value.node_, value.owner_);
-      next += 2;
-    }
-    return Access::make(plist::finishDictionary(pairs, count), document.handOver());
-  } catch (const std::bad_alloc&) {
-    return {};
+  const std::size_t table = plist::dictionaryBytes(count);
+  DocumentHolder document(table + room + sizeof(Node));
+  auto* const pairs = static_cast<Node*>(document->allocate(table));
+  Node* next = pairs;
+  for (const auto& [key, value] : entries) {
+    if (!value) continue;
+    *next = keyNode(key);
+    next->text = document->copyText(key.data(), key.size());
+    next[1] = place(*document, value.node_, value.owner_);
+    next += 2;
   }
+  return Access::make(plist::finishDictionary(pairs, count), document.handOver());
 }
 
-PropertyList PropertyList::withEntry(std::string_view key, const PropertyList& value) const noexcept {
+PropertyList PropertyList::withEntry(std::string_view key, const PropertyList& value) const {
   if (node_.tag != Tag::dictionary || key.size() > kLargestCount || !isValidUtf8(key)) return {};
   const Node wanted = keyNode(key);
   const Node* const old = node_.size == 0 ? nullptr : plist::findKey(node_, wanted);
@@ -292,29 +299,25 @@ PropertyList PropertyList::withEntry(std::string_view key, const PropertyList& v
   for (const Node* pair = node_.children; pair != end; pair += 2) {
     room += pair->size + roomFor(plist::resolved(pair[1]));
   }
-  try {
-    const std::size_t table = plist::dictionaryBytes(count);
-    DocumentHolder document(table + room + sizeof(Node));
-    auto* const pairs = static_cast<Node*>(document->allocate(table));
-    Node* next = pairs;
-    auto add = [&](const Node& entryKey, const Node& entryValue, const Document* owner) {
-      *next = entryKey;
-      next->text = document->copyText(entryKey.text, entryKey.size);
-      next[1] = place(*document, entryValue, owner);
-      next += 2;
-    };
-    for (const Node* pair = node_.children; pair != end; pair += 2) {
-      if (pair != old) {
-        add(pair[0], pair[1], owner_);
-      } else if (value) {
-        add(pair[0], value.node_, value.owner_);
-      }
+  const std::size_t table = plist::dictionaryBytes(count);
+  DocumentHolder document(table + room + sizeof(Node));
+  auto* const pairs = static_cast<Node*>(document->allocate(table));
+  Node* next = pairs;
+  auto add = [&](const Node& entryKey, const Node& entryValue, const Document* owner) {
+    *next = entryKey;
+    next->text = document->copyText(entryKey.text, entryKey.size);
+    next[1] = place(*document, entryValue, owner);
+    next += 2;
+  };
+  for (const Node* pair = node_.children; pair != end; pair += 2) {
+    if (pair != old) {
+      add(pair[0], pair[1], owner_);
+    } else if (value) {
+      add(pair[0], value.node_, value.owner_);
     }
-    if (old == nullptr) add(wanted, value.node_, value.owner_);
-    return Access::make(plist::finishDictionary(pairs, count), document.handOver());
-  } catch (const std::bad_alloc&) {
-    return {};
   }
+  if (old == nullptr) add(wanted, value.node_, value.owner_);
+  return Access::make(plist::finishDictionary(pairs, count), document.handOver());
 }
 
 PropertyList::Type PropertyList::type() const noexcept {
@@ -396,19 +399,15 @@ PropertyList PropertyList::find(std::string_view key) const noexcept {
   return found == nullptr ? PropertyList() : share(found[1], owner_);
 }
 
-bool PropertyList::operator==(const PropertyList& other) const noexcept {
-  try {
-    // Nearly every comparison ends here, without the cost of keeping classes.
-    constexpr std::size_t kStepsWithoutMemory = 1 << 16;
-    Answer answer = compare(node_, other.node_, nullptr, kStepsWithoutMemory);
-    if (answer == Answer::tooManySteps) {
-      EqualClasses classes;
-      answer = compare(node_, other.node_, &classes, 0);
-    }
-    return answer == Answer::equal;
-  } catch (const std::bad_alloc&) {
-    return false;
+bool PropertyList::operator==(const PropertyList& other) const {
+  // Nearly every comparison ends here, without the cost of keeping classes.
+  constexpr std::size_t kStepsWithoutMemory = 1 << 16;
+  Answer answer = Comparison(nullptr, kStepsWithoutMemory).compare(node_, other.node_);
+  if (answer == Answer::tooManySteps) {
+    EqualClasses classes;
+    answer = Comparison(&classes, 0).compare(node_, other.node_);
   }
+  return answer == Answer::equal;
 }
 
 }  // namespace brenvik

@@ -16,8 +16,8 @@
 namespace brenvik {
 
 // An immutable property-list value, or no value at all. Copies share what they hold; a value may be read
-// from any thread. Destroying the deepest or most shared value takes no recursion. Nothing here throws:
-// where memory runs out, there is no value.
+// from any thread. Destroying the deepest or most shared value takes no recursion. What makes a value of a
+// text or of other values, and comparison, may throw std::bad_alloc; nothing else throws.
 //
 // A value taken out of a parsed document keeps that document's memory alive as long as it lives.
 class PropertyList {
@@ -38,18 +38,17 @@ class PropertyList {
   static PropertyList integer(std::int64_t value) noexcept;
   static PropertyList unsignedInteger(std::uint64_t value) noexcept;
   static PropertyList real(double value) noexcept;
-  static PropertyList string(std::string_view utf8) noexcept;  // no value when it is not valid UTF-8
-  static PropertyList data(std::span<const std::byte> bytes) noexcept;
-  static PropertyList date(double secondsSince2001) noexcept;  // since 2001-01-01T00:00:00Z
-  static PropertyList array(
-      const std::vector<PropertyList>& elements) noexcept;  // absent elements are left out
+  static PropertyList string(std::string_view utf8);  // no value when it is not valid UTF-8
+  static PropertyList data(std::span<const std::byte> bytes);
+  static PropertyList date(double secondsSince2001) noexcept;            // since 2001-01-01T00:00:00Z
+  static PropertyList array(const std::vector<PropertyList>& elements);  // absent elements are left out
   // Keys in the order given; of equal keys the last value stands. Absent values are left out. No value when
   // a key is not valid UTF-8.
-  static PropertyList dictionary(const std::vector<std::pair<std::string, PropertyList>>& entries) noexcept;
+  static PropertyList dictionary(const std::vector<std::pair<std::string, PropertyList>>& entries);
 
   // A dictionary with the entry set (in its old place, or last) or, with an absent value, without it. Costs
   // one pass over the entries. No value when this is not a dictionary or the key is not valid UTF-8.
-  PropertyList withEntry(std::string_view key, const PropertyList& value) const noexcept;
+  PropertyList withEntry(std::string_view key, const PropertyList& value) const;
 
   bool hasValue() const noexcept { return node_.tag != plist::Tag::none; }
   explicit operator bool() const noexcept { return hasValue(); }
@@ -76,8 +75,8 @@ class PropertyList {
   PropertyList find(std::string_view key) const noexcept;
 
   // Deep equality, in time linear in what is stored however much of it is shared. Dictionaries compare
-  // without regard to order; a real that is not a number equals another one. False when memory runs out.
-  bool operator==(const PropertyList& other) const noexcept;
+  // without regard to order; a real that is not a number equals another one.
+  bool operator==(const PropertyList& other) const;
 
  private:
   friend struct plist::Access;

@@ -3,7 +3,6 @@
 #pragma once
 
 #include <array>
-#include <cstdint>
 #include <string>
 #include <string_view>
 
@@ -32,67 +31,40 @@ constexpr bool namesPreferencesFile(std::string_view domain) noexcept {
          domain.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
 }
 
-// How far synchronizing came; true when whole.
-class Synchronized {
- public:
-  static constexpr Synchronized whole() noexcept { return Synchronized(State::whole); }
-  static constexpr Synchronized notWhole() noexcept { return Synchronized(State::notWhole); }
-  // Not whole, and what others have stored may not have been seen.
-  static constexpr Synchronized withoutMemory() noexcept { return Synchronized(State::withoutMemory); }
-
-  constexpr operator bool() const noexcept { return state_ == State::whole; }
-  constexpr bool lackedMemory() const noexcept { return state_ == State::withoutMemory; }
-
- private:
-  enum class State : std::uint8_t { whole, notWhole, withoutMemory };
-  constexpr explicit Synchronized(State state) noexcept : state_(state) {}
-  State state_;
-};
-
 // The platform's preferences: values by domain, key, user scope and host scope. Any thread. Texts are UTF-8.
 //
 // A set value is seen by this process at once and by other processes after synchronize(). What others have
 // stored, replaced or removed is seen by every read. A domain that names no file, or whose folder is not
 // known at the moment, reads as having no values; setting a value there stores nothing and logs an error.
-// Nothing is thrown: each operation tells whether memory sufficed.
+//
+// Every function but flushCachesForAnyUser() throws std::bad_alloc when memory runs out, and nothing else.
 class PreferencesStore {
  public:
   virtual ~PreferencesStore() = default;
 
-  // Sets the key's value; no value removes the key. False when memory ran out and nothing was set.
-  virtual bool setValue(std::string_view key, const PropertyList& value, std::string_view domain,
-                        UserScope user, HostScope host) noexcept = 0;
+  // Sets the key's value; an absent value removes the key. When it throws, nothing was set, which is logged.
+  virtual void setValue(std::string_view key, const PropertyList& value, std::string_view domain,
+                        UserScope user, HostScope host) = 0;
 
   // Makes what was set durable and reads what others wrote; keys that were not set here stay as others left
-  // them. Not whole when something set could not be stored, which is logged; it is then dropped, so that what
-  // is read is what is stored. Not whole, too, for a domain that names no file.
-  virtual Synchronized synchronize(std::string_view domain, UserScope user, HostScope host) noexcept = 0;
+  // them. True if every change was written. False when something set could not be stored, which is logged; it
+  // is then dropped, so that what is read is what is stored. False, too, for a domain that names no file.
+  // When it throws, the same holds, and what others have stored may not have been seen.
+  virtual bool synchronize(std::string_view domain, UserScope user, HostScope host) = 0;
 
-  // The key's value in exactly this scope, or none, in *value: what was set here and not synchronized yet,
-  // else what is stored now. False when memory ran out, and it is not known.
-  virtual bool readValue(std::string_view key, std::string_view domain, UserScope user, HostScope host,
-                         PropertyList* value) noexcept = 0;
+  // The key's value in exactly this scope, or none: what was set here and not synchronized yet, else what is
+  // stored now.
+  virtual PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
+                                 HostScope host) = 0;
 
   // Application scope: the first of kApplicationScopes that has the key gives the value. A scope that has no
   // place on this system is passed over.
-  virtual Synchronized synchronizeApplication(std::string_view domain) noexcept = 0;
-  virtual bool readApplicationValue(std::string_view key, std::string_view domain,
-                                    PropertyList* value) noexcept = 0;
-
-  // For callers that treat "out of memory" like "no value".
-  PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
-                         HostScope host) noexcept {
-    PropertyList value;
-    return readValue(key, domain, user, host, &value) ? value : PropertyList();
-  }
-  PropertyList copyApplicationValue(std::string_view key, std::string_view domain) noexcept {
-    PropertyList value;
-    return readApplicationValue(key, domain, &value) ? value : PropertyList();
-  }
+  virtual bool synchronizeApplication(std::string_view domain) = 0;
+  virtual PropertyList copyApplicationValue(std::string_view key, std::string_view domain) = 0;
 
   // Forgets what is cached of the domain for any user and of every host, so that the next read goes to the
-  // files. `domain` null: of no domain in particular, which flushes nothing. Values set and not yet
-  // synchronized are kept.
+  // files. Null: of no domain in particular, which flushes nothing. Values set and not yet synchronized are
+  // kept. A lack of memory is logged.
   virtual void flushCachesForAnyUser(const std::string* domain) noexcept = 0;
 };
 

@@ -108,9 +108,7 @@ void CountryConfiguration::refreshConfiguration() {
   }
   if (content) {
     identity = identityOf(status);
-    CodecFailure failure{};
-    const PropertyList file = parsePropertyList(std::as_bytes(std::span(*content)), &failure);
-    if (failure == CodecFailure::noMemory) throw std::bad_alloc();
+    const PropertyList file = parsePropertyList(std::as_bytes(std::span(*content)));
     const PropertyList value = file.find("CountryCode");
     if (const auto code = value.asString(); code && !code->empty()) configured_ = *code;
   }

@@ -4,6 +4,7 @@
 
 #include <map>
 #include <mutex>
+#include <new>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -63,66 +64,56 @@ class InMemoryPreferences final : public PreferencesStore {
 
   InMemoryDisk& disk() noexcept { return *disk_; }
 
-  bool setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
-                HostScope host) noexcept override {
+  void setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
+                HostScope host) override {
     if (!namesPreferencesFile(domain)) {
       logUnified(LogLevel::error, "Preferences: domain \"%.*s\" names no file, nothing is stored",
                  static_cast<int>(domain.size()), domain.data());
-      return true;
+      return;
     }
-    if (runsOutOfMemory()) return false;
+    takeMemory();
     const std::lock_guard lock(mutex_);
     pending_[{std::string(domain), user, host}].insert_or_assign(std::string(key), value);
-    return true;
   }
 
-  Synchronized synchronize(std::string_view domain, UserScope user, HostScope host) noexcept override {
-    if (!namesPreferencesFile(domain)) return Synchronized::notWhole();
+  bool synchronize(std::string_view domain, UserScope user, HostScope host) override {
+    if (!namesPreferencesFile(domain)) return false;
     const std::lock_guard lock(mutex_);
     const InMemoryDisk::DomainName name{std::string(domain), user, host};
     auto pending = std::exchange(pending_[name], {});
-    if (runsOutOfMemory()) return Synchronized::withoutMemory();
+    takeMemory();
     const bool isSound =
         std::erase_if(pending, [](const auto& one) { return !canBeStored(one.first, one.second); }) == 0;
     if (!isSound) logUnified(LogLevel::error, "Preferences: a value is too deep or too large to be stored");
     const bool isStored = pending.empty() || disk_->merge(name, pending);
     if (!isStored) logUnified(LogLevel::error, "Preferences: the disk is full");
-    return isStored && isSound ? Synchronized::whole() : Synchronized::notWhole();
+    return isStored && isSound;
   }
 
-  bool readValue(std::string_view key, std::string_view domain, UserScope user, HostScope host,
-                 PropertyList* value) noexcept override {
-    *value = {};
-    if (!namesPreferencesFile(domain)) return true;
-    if (runsOutOfMemory()) return false;
+  PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
+                         HostScope host) override {
+    if (!namesPreferencesFile(domain)) return {};
+    takeMemory();
     const std::lock_guard lock(mutex_);
     const InMemoryDisk::DomainName name{std::string(domain), user, host};
     const InMemoryDisk::Values& pending = pending_[name];
-    if (const auto set = pending.find(key); set != pending.end()) {
-      *value = set->second;
-      return true;
-    }
+    if (const auto set = pending.find(key); set != pending.end()) return set->second;
     const InMemoryDisk::Values values = disk_->read(name);
-    if (const auto found = values.find(key); found != values.end()) *value = found->second;
-    return true;
+    const auto found = values.find(key);
+    return found != values.end() ? found->second : PropertyList();
   }
 
-  Synchronized synchronizeApplication(std::string_view domain) noexcept override {
-    Synchronized all = Synchronized::whole();
-    for (const auto [user, host] : kApplicationScopes) {
-      const Synchronized one = synchronize(domain, user, host);
-      if (!one && !all.lackedMemory()) all = one;
-    }
-    return all;
+  bool synchronizeApplication(std::string_view domain) override {
+    bool isWhole = true;
+    for (const auto [user, host] : kApplicationScopes) isWhole = synchronize(domain, user, host) && isWhole;
+    return isWhole;
   }
 
-  bool readApplicationValue(std::string_view key, std::string_view domain,
-                            PropertyList* value) noexcept override {
+  PropertyList copyApplicationValue(std::string_view key, std::string_view domain) override {
     for (const auto [user, host] : kApplicationScopes) {
-      if (!readValue(key, domain, user, host, value)) return false;
-      if (*value) return true;
+      if (PropertyList value = copyValue(key, domain, user, host)) return value;
     }
-    return true;
+    return {};
   }
 
   void flushCachesForAnyUser(const std::string* domain) noexcept override {
@@ -138,11 +129,10 @@ class InMemoryPreferences final : public PreferencesStore {
   int operationsWithMemory = -1;
 
  private:
-  bool runsOutOfMemory() noexcept {
-    if (operationsWithMemory < 0) return false;
-    if (operationsWithMemory == 0) return true;
-    --operationsWithMemory;
-    return false;
+  // Counts one operation.
+  void takeMemory() {
+    if (operationsWithMemory == 0) throw std::bad_alloc();
+    if (operationsWithMemory > 0) --operationsWithMemory;
   }
 
   // A domain is a dictionary, so a value may be a level less deep than a document.

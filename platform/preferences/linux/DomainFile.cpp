@@ -50,16 +50,29 @@ bool isPassing(int error) noexcept {
   return error == EMFILE || error == ENFILE || error == ENOMEM || error == EINTR || error == EAGAIN;
 }
 
+// Fills `bytes`; shortens them when the file is shorter by now. 0, or an errno.
+int readWhole(int file, std::string& bytes) noexcept {
+  std::size_t filled = 0;
+  while (filled < bytes.size()) {
+    const ssize_t got =
+        ::pread(file, bytes.data() + filled, bytes.size() - filled, static_cast<off_t>(filled));
+    if (got < 0 && errno == EINTR) continue;
+    if (got < 0) return errno;
+    if (got == 0) break;
+    filled += static_cast<std::size_t>(got);
+  }
+  bytes.resize(filled);
+  return 0;
+}
+
 // What is wrong with a domain's file, or null and its content.
-const char* parse(std::string_view bytes, DomainImage& image) {
-  CodecFailure failure{};
-  const PropertyList document = parsePropertyList(std::as_bytes(std::span(bytes)), &failure);
-  if (failure == CodecFailure::noMemory) throw std::bad_alloc();
+const char* parse(std::string_view bytes, EditableDictionary& values) {
+  const PropertyList document = parsePropertyList(std::as_bytes(std::span(bytes)));
   if (!document) return "not a property list";
   if (!document.is(PropertyList::Type::dictionary)) return "not a dictionary";
-  auto found = DomainImage::of(document);
+  auto found = EditableDictionary::of(document);
   if (!found) return "too large when taken apart";
-  image = std::move(*found);
+  values = std::move(*found);
   return nullptr;
 }
 
@@ -107,6 +120,27 @@ int FolderLock::take(int folder, std::chrono::milliseconds patience) noexcept {
   }
 }
 
+// Reads the open file whole, and again when it changes meanwhile: programs that know nothing of the lock may
+// be writing it in place. Notes what is wrong, if anything.
+void DomainFile::readContent(Attempt& attempt, std::string& bytes) {
+  const int file = attempt.loaded.pin.get();
+  struct stat facts;
+  if (::fstat(file, &facts) != 0) return attempt.fail(errno);
+  for (int round = 1;; ++round) {
+    if (!S_ISREG(facts.st_mode)) return attempt.damaged("not a regular file");
+    if (static_cast<std::uint64_t>(facts.st_size) > EditableDictionary::kMaxFileSize) {
+      return attempt.damaged("too large");
+    }
+    attempt.loaded.stamp = stampOf(facts);
+    bytes.resize(static_cast<std::size_t>(facts.st_size));
+    if (const int error = readWhole(file, bytes); error != 0) {
+      return isPassing(error) ? attempt.fail(error) : attempt.damaged("unreadable", error);
+    }
+    if (::fstat(file, &facts) != 0) return attempt.fail(errno);
+    if (stampOf(facts) == attempt.loaded.stamp || round == kReadAttempts) return;
+  }
+}
+
 DomainFile::Attempt DomainFile::tryLoad() const {
   Attempt attempt;
   Loaded& loaded = attempt.loaded;
@@ -116,48 +150,22 @@ DomainFile::Attempt DomainFile::tryLoad() const {
   if (!loaded.pin.isValid()) {
     const int error = errno;
     if (error == ENOENT || error == ENOTDIR || error == ENAMETOOLONG) return attempt;
-    loaded.state = State::unavailable;
-    attempt.error = error;
-    if (!isPassing(error)) attempt.damage = "unreadable";
+    if (isPassing(error)) {
+      attempt.fail(error);
+    } else {
+      attempt.damaged("unreadable", error);
+    }
     return attempt;
   }
-  const auto damaged = [&attempt](const char* what, int error = 0) -> Attempt {
-    attempt.loaded.state = State::unavailable;
-    attempt.loaded.image = DomainImage();
-    attempt.damage = what;
-    attempt.error = error;
-    return std::move(attempt);
-  };
-  const auto passing = [&attempt](int error) -> Attempt {
-    attempt.loaded.state = State::unavailable;
-    attempt.error = error;
-    return std::move(attempt);
-  };
-  std::string bytes;
-  for (int round = 1;; ++round) {
-    struct stat facts;
-    if (::fstat(loaded.pin.get(), &facts) != 0) return passing(errno);
-    if (!S_ISREG(facts.st_mode)) return damaged("not a regular file");
-    if (static_cast<std::uint64_t>(facts.st_size) > kLargestDomain) return damaged("too large");
-    loaded.stamp = stampOf(facts);
-    bytes.resize(static_cast<std::size_t>(facts.st_size));
-    std::size_t filled = 0;
-    while (filled < bytes.size()) {
-      const ssize_t got =
-          ::pread(loaded.pin.get(), bytes.data() + filled, bytes.size() - filled, static_cast<off_t>(filled));
-      if (got < 0 && errno == EINTR) continue;
-      if (got < 0) return isPassing(errno) ? passing(errno) : damaged("unreadable", errno);
-      if (got == 0) break;
-      filled += static_cast<std::size_t>(got);
-    }
-    bytes.resize(filled);
-    // Programs that know nothing of the lock may be writing it in place.
-    if (::fstat(loaded.pin.get(), &facts) != 0) return passing(errno);
-    if (stampOf(facts) == loaded.stamp || round == kReadAttempts) break;
-  }
-  // A lack of memory leaves by an exception: a good file is not to be moved aside for it.
-  if (const char* const damage = parse(bytes, loaded.image); damage != nullptr) return damaged(damage);
   loaded.state = State::read;
+  std::string bytes;
+  readContent(attempt, bytes);
+  if (loaded.state != State::read) return attempt;
+  // A lack of memory leaves by an exception: a good file is not to be moved aside for it.
+  if (const char* const damage = parse(bytes, loaded.values); damage != nullptr) {
+    attempt.damaged(damage);
+    return attempt;
+  }
   timespec now{};
   ::clock_gettime(CLOCK_REALTIME, &now);
   loaded.isSettled = nanoseconds(now) - loaded.stamp.modified > kSettlingTime;

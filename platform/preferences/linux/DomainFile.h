@@ -13,7 +13,7 @@
 #include <string_view>
 
 #include "platform/base/UniqueFd.h"
-#include "platform/preferences/linux/DomainImage.h"
+#include "platform/plist/EditableDictionary.h"
 
 namespace brenvik {
 
@@ -66,7 +66,7 @@ class DomainFile {
   };
   struct Loaded {
     State state = State::absent;
-    DomainImage image;
+    EditableDictionary values;
     FileStamp stamp;
     // Keeps the inode's number from being given to another file as long as the stamp is compared.
     UniqueFd pin;
@@ -94,8 +94,19 @@ class DomainFile {
     Loaded loaded;
     const char* damage = nullptr;  // what is wrong with the file, if anything
     int error = 0;                 // and the errno that says so, or 0
+
+    // The file is not to blame.
+    void fail(int why) noexcept {
+      loaded.state = State::unavailable;
+      error = why;
+    }
+    void damaged(const char* what, int why = 0) noexcept {
+      fail(why);
+      damage = what;
+    }
   };
   Attempt tryLoad() const;
+  static void readContent(Attempt& attempt, std::string& bytes);
   bool moveAside(int folder, const Attempt& attempt) const;
   bool fail(const char* call, int error) const noexcept;
 

@@ -17,8 +17,8 @@
 #include "platform/base/PasswordEntry.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/log/Log.h"
+#include "platform/plist/EditableDictionary.h"
 #include "platform/preferences/linux/DomainFile.h"
-#include "platform/preferences/linux/DomainImage.h"
 
 #ifndef BRENVIK_ANY_USER_PREFERENCES
 #error "the build says where the preferences of any user are"
@@ -53,6 +53,17 @@ std::string machineId(int* failure) {
   return isId ? id : std::string();
 }
 
+// Runs the work of a store; a lack of memory passes on, logged.
+template <typename Work>
+bool loggingLackOfMemory(Work work) {
+  try {
+    return work();
+  } catch (const std::bad_alloc&) {
+    logUnified(LogLevel::error, "Preferences: no memory to store a domain");
+    throw;
+  }
+}
+
 void keepKnown(std::string& known, std::string& found) noexcept {
   if (!known.empty()) found = std::move(known);
 }
@@ -81,7 +92,7 @@ class FilePreferences::Domain {
     if (const auto set = pending_.find(key); set != pending_.end()) return set->second;
     // Somebody may have replaced or removed the file since: one look, and a read only if it changed.
     if (!isCurrent()) load(nullptr);
-    return image_.find(key);
+    return values_.find(key);
   }
 
   bool synchronize() {
@@ -112,14 +123,14 @@ class FilePreferences::Domain {
   std::optional<std::size_t> weight() {
     const std::unique_lock lock(mutex_, std::try_to_lock);
     if (!lock.owns_lock() || !pending_.empty()) return std::nullopt;
-    return image_.memory();
+    return values_.memory();
   }
 
  private:
   bool isCurrent() const noexcept { return isLoaded_ && isSettled_ && file_.stamp() == stamp_; }
 
   void forgetContent() noexcept {
-    image_ = DomainImage();
+    values_ = EditableDictionary();
     stamp_ = {};
     pin_.reset();
     isLoaded_ = isDurable_ = canStore_ = false;
@@ -128,7 +139,7 @@ class FilePreferences::Domain {
   void load(const FolderLock* held) {
     forgetContent();
     DomainFile::Loaded loaded = file_.load(patience_, held);
-    image_ = std::move(loaded.image);
+    values_ = std::move(loaded.values);
     stamp_ = loaded.stamp;
     pin_ = std::move(loaded.pin);
     isSettled_ = loaded.isSettled;
@@ -145,13 +156,13 @@ class FilePreferences::Domain {
     bool isWhole = true;
     bool isChanged = false;
     for (const auto& [key, value] : pending_) {
-      switch (image_.set(key, value)) {
-        case DomainImage::Change::none:
+      switch (values_.set(key, value)) {
+        case EditableDictionary::Change::none:
           break;
-        case DomainImage::Change::made:
+        case EditableDictionary::Change::made:
           isChanged = true;
           break;
-        case DomainImage::Change::refused:
+        case EditableDictionary::Change::refused:
           logUnified(LogLevel::error, "Preferences %s: a value is too deep or too large to be stored",
                      path().c_str());
           isWhole = false;
@@ -163,7 +174,7 @@ class FilePreferences::Domain {
     const bool isStored = !isChanged && (isDurable_ || stamp_.size < 0);
     if (isStored) return isWhole;
     isDurable_ = false;
-    const auto content = image_.content();
+    const auto content = values_.content();
     if (!file_.replace(folder.get(), content, stamp_, pin_)) return false;
     isDurable_ = isSettled_ = true;
     return isWhole;
@@ -176,7 +187,7 @@ class FilePreferences::Domain {
 
   std::mutex mutex_;                                          // of what follows
   std::map<std::string, PropertyList, std::less<>> pending_;  // no value: to be removed
-  DomainImage image_;                                         // of the file
+  EditableDictionary values_;                                 // of the file
   FileStamp stamp_;
   UniqueFd pin_;
   bool isLoaded_ = false;
@@ -276,62 +287,48 @@ std::shared_ptr<FilePreferences::Domain> FilePreferences::find(std::string_view 
   return domains_.front();
 }
 
-bool FilePreferences::setValue(std::string_view key, const PropertyList& value, std::string_view domain,
-                               UserScope user, HostScope host) noexcept {
+void FilePreferences::setValue(std::string_view key, const PropertyList& value, std::string_view domain,
+                               UserScope user, HostScope host) {
   try {
     if (const auto found = find(domain, user, host)) {
       found->setValue(key, value);
     } else {
       logNothingStored(domain, user, host);
     }
-    return true;
   } catch (const std::bad_alloc&) {
     logUnified(LogLevel::error, "Preferences: no memory to set a value");
-    return false;
+    throw;
   }
 }
 
-Synchronized FilePreferences::synchronize(std::string_view domain, UserScope user, HostScope host) noexcept {
-  try {
+bool FilePreferences::synchronize(std::string_view domain, UserScope user, HostScope host) {
+  return loggingLackOfMemory([&] {
     const auto found = find(domain, user, host);
-    return found != nullptr && found->synchronize() ? Synchronized::whole() : Synchronized::notWhole();
-  } catch (const std::bad_alloc&) {
-    logUnified(LogLevel::error, "Preferences: no memory to store a domain");
-    return Synchronized::withoutMemory();
-  }
+    return found != nullptr && found->synchronize();
+  });
 }
 
-bool FilePreferences::readValue(std::string_view key, std::string_view domain, UserScope user, HostScope host,
-                                PropertyList* value) noexcept {
-  try {
-    const auto found = find(domain, user, host);
-    *value = found != nullptr ? found->copyValue(key) : PropertyList();
-    return true;
-  } catch (const std::bad_alloc&) {
-    return false;
-  }
+PropertyList FilePreferences::copyValue(std::string_view key, std::string_view domain, UserScope user,
+                                        HostScope host) {
+  const auto found = find(domain, user, host);
+  return found != nullptr ? found->copyValue(key) : PropertyList();
 }
 
-Synchronized FilePreferences::synchronizeApplication(std::string_view domain) noexcept {
-  bool isWhole = namesPreferencesFile(domain);
-  try {
+bool FilePreferences::synchronizeApplication(std::string_view domain) {
+  return loggingLackOfMemory([&] {
+    bool isWhole = namesPreferencesFile(domain);
     for (const auto [user, host] : kApplicationScopes) {
       if (const auto found = find(domain, user, host)) isWhole = found->synchronize() && isWhole;
     }
-  } catch (const std::bad_alloc&) {
-    logUnified(LogLevel::error, "Preferences: no memory to store a domain");
-    return Synchronized::withoutMemory();
-  }
-  return isWhole ? Synchronized::whole() : Synchronized::notWhole();
+    return isWhole;
+  });
 }
 
-bool FilePreferences::readApplicationValue(std::string_view key, std::string_view domain,
-                                           PropertyList* value) noexcept {
+PropertyList FilePreferences::copyApplicationValue(std::string_view key, std::string_view domain) {
   for (const auto [user, host] : kApplicationScopes) {
-    if (!readValue(key, domain, user, host, value)) return false;
-    if (*value) return true;
+    if (PropertyList value = copyValue(key, domain, user, host)) return value;
   }
-  return true;
+  return {};
 }
 
 void FilePreferences::flushCachesForAnyUser(const std::string* domain) noexcept {

@@ -51,14 +51,13 @@ class FilePreferences final : public PreferencesStore {
   FilePreferences& operator=(const FilePreferences&) = delete;
   ~FilePreferences() override;
 
-  bool setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
-                HostScope host) noexcept override;
-  Synchronized synchronize(std::string_view domain, UserScope user, HostScope host) noexcept override;
-  bool readValue(std::string_view key, std::string_view domain, UserScope user, HostScope host,
-                 PropertyList* value) noexcept override;
-  Synchronized synchronizeApplication(std::string_view domain) noexcept override;
-  bool readApplicationValue(std::string_view key, std::string_view domain,
-                            PropertyList* value) noexcept override;
+  void setValue(std::string_view key, const PropertyList& value, std::string_view domain, UserScope user,
+                HostScope host) override;
+  bool synchronize(std::string_view domain, UserScope user, HostScope host) override;
+  PropertyList copyValue(std::string_view key, std::string_view domain, UserScope user,
+                         HostScope host) override;
+  bool synchronizeApplication(std::string_view domain) override;
+  PropertyList copyApplicationValue(std::string_view key, std::string_view domain) override;
   void flushCachesForAnyUser(const std::string* domain) noexcept override;
 
  private:

@@ -24,8 +24,8 @@
 
 #include "platform/base/UniqueFd.h"
 #include "platform/log/fakes/RecordingLog.h"
+#include "platform/plist/EditableDictionary.h"
 #include "platform/plist/PropertyListCodec.h"
-#include "platform/preferences/linux/DomainImage.h"
 #include "platform/preferences/linux/TestHome.h"
 
 namespace brenvik {

@@ -303,9 +303,7 @@ class EntitlementSearch::Run {
     std::vector<std::byte> bytes(static_cast<std::size_t>(facts.st_size));
     // A regular file gives all it has at once, unless it fails or is being changed.
     if (::read(fd.get(), bytes.data(), bytes.size()) != facts.st_size) return Verdict::undecidable;
-    CodecFailure failure{};
-    *content = parsePropertyList(bytes, &failure);
-    if (failure == CodecFailure::noMemory) return Verdict::undecidable;
+    *content = parsePropertyList(bytes);
     if (!content->is(Type::dictionary)) return passOverWhole("not a property list of the right form");
     return Verdict::matches;
   }

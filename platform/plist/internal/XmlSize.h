@@ -2,13 +2,14 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <algorithm>
 #include <cstddef>
 #include <cstdint>
 
 #include "platform/plist/Node.h"
 #include "platform/plist/PropertyListCodec.h"
 
-// Internal to this folder: how large a value is as XML, without writing it.
+// How large a value is as XML, without writing it.
 namespace brenvik::plist {
 
 // What surrounds the value. The document type is the one every writer of this format emits.
@@ -46,6 +47,21 @@ inline constexpr XmlExtent tagExtent(Tag container) noexcept {
 // At least the extent of a value or a key that is no container, or an empty one; costs nothing to find.
 inline XmlExtent largestExtent(const Node& node) noexcept {
   return {64 + std::uint64_t{5} * node.size, 3 + node.size / 32};
+}
+
+// What a reader or writer of another format sums up of a value.
+struct Measure {
+  XmlExtent extent;        // at least
+  std::size_t height = 0;  // levels of containers, an empty one included
+
+  void addChild(const Measure& child) noexcept {
+    extent.addChild(child.extent);
+    height = std::max(height, child.height + 1);
+  }
+};
+// Of a value or a key that is no container, or an empty one.
+inline Measure leafMeasure(const Node& node) noexcept {
+  return {largestExtent(node), std::size_t{node.isContainer()}};
 }
 
 inline bool fitsXmlLimit(const XmlExtent& extent) noexcept {

@@ -6,8 +6,8 @@
 #include <span>
 #include <string>
 
+#include "platform/plist/EditableDictionary.h"
 #include "platform/plist/PropertyListCodec.h"
-#include "platform/preferences/linux/DomainImage.h"
 
 namespace {
 
@@ -15,8 +15,8 @@ using namespace brenvik;
 
 PropertyList parse(std::string_view bytes) { return parsePropertyList(std::as_bytes(std::span(bytes))); }
 
-std::string contentOf(DomainImage& image) {
-  const auto pieces = image.content();
+std::string contentOf(EditableDictionary& edited) {
+  const auto pieces = edited.content();
   return std::string(pieces[0]) + std::string(pieces[1]);
 }
 
@@ -31,22 +31,23 @@ void require(bool holds) {
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const PropertyList before = parsePropertyList(std::as_bytes(std::span(data, size)));
   if (!before.is(PropertyList::Type::dictionary)) return 0;
-  auto image = DomainImage::of(before);
-  if (!image) return 0;
-  require(parse(contentOf(*image)) == before);
+  auto edited = EditableDictionary::of(before);
+  if (!edited) return 0;
+  require(parse(contentOf(*edited)) == before);
 
   // Each value moves to a new key, the old one gets another value or goes.
   PropertyList expected = before;
   for (std::size_t i = 0; i < before.size() && i < 64; ++i) {
     const std::string key(before.keyAt(i));
     const PropertyList value = before.at(i);
-    require(image->find(key) == expected.find(key));
+    require(edited->find(key) == expected.find(key));
     const auto change = [&](const std::string& name, const PropertyList& to) {
-      if (image->set(name, to) != DomainImage::Change::refused) expected = expected.withEntry(name, to);
+      if (edited->set(name, to) != EditableDictionary::Change::refused)
+        expected = expected.withEntry(name, to);
     };
     change(key + "'", value);
     change(key, i % 3 == 0 ? PropertyList() : i % 3 == 1 ? PropertyList::string("other") : before);
   }
-  require(parse(contentOf(*image)) == expected);
+  require(parse(contentOf(*edited)) == expected);
   return 0;
 }

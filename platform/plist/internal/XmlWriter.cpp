@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/plist/XmlWriter.h"
+#include "platform/plist/internal/XmlWriter.h"
 
 #include <algorithm>
 #include <array>
@@ -11,8 +11,9 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/plist/Calendar.h"
-#include "platform/plist/Document.h"
+#include "platform/base/Base64.h"
+#include "platform/plist/internal/Dates.h"
+#include "platform/plist/internal/Document.h"
 
 namespace brenvik::plist {
 namespace {
@@ -60,36 +61,6 @@ std::uint64_t load64(const char* bytes) noexcept {
   return word;
 }
 
-constexpr char kBase64[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-
-// The two characters for each twelve bits.
-constexpr std::array<std::array<char, 2>, 4096> kBase64Pairs = [] {
-  std::array<std::array<char, 2>, 4096> pairs{};
-  for (std::size_t i = 0; i < pairs.size(); ++i) pairs[i] = {kBase64[i >> 6], kBase64[i & 63]};
-  return pairs;
-}();
-
-char* encodeLine(const unsigned char* bytes, std::size_t size, char* to) noexcept {
-  for (; size >= 3; size -= 3, bytes += 3) {
-    const std::uint32_t group = std::uint32_t{bytes[0]} << 16 | std::uint32_t{bytes[1]} << 8 | bytes[2];
-    std::memcpy(to, kBase64Pairs[group >> 12].data(), 2);
-    std::memcpy(to + 2, kBase64Pairs[group & 0xFFF].data(), 2);
-    to += 4;
-  }
-  if (size == 0) return to;
-  const std::uint32_t group = std::uint32_t{bytes[0]} << 16 | (size == 2 ? std::uint32_t{bytes[1]} << 8 : 0u);
-  to[0] = kBase64[group >> 18];
-  to[1] = kBase64[group >> 12 & 63];
-  to[2] = size == 2 ? kBase64[group >> 6 & 63] : '=';
-  to[3] = '=';
-  return to + 4;
-}
-
-char* digits(char* to, std::int64_t number, int width) noexcept {
-  for (int i = width - 1; i >= 0; --i, number /= 10) to[i] = static_cast<char>('0' + number % 10);
-  return to + width;
-}
-
 // Longest form of a number or a date.
 constexpr std::size_t kScalarRoom = 32;
 
@@ -97,32 +68,6 @@ char* formatReal(char* to, double number) noexcept {
   // The sign of what is not a number means nothing to a reader.
   if (std::isnan(number)) number = std::abs(number);
   return std::to_chars(to, to + kScalarRoom, number).ptr;
-}
-
-// Null when there is no such date in the format.
-char* formatDate(char* to, double seconds) noexcept {
-  // The form has no fractions; the second that has begun stands. Not a number fails both comparisons.
-  if (!(seconds >= static_cast<double>(kFirstSecond) && seconds < static_cast<double>(kSecondAfterLast)))
-    return nullptr;
-  auto whole = static_cast<std::int64_t>(seconds);
-  if (static_cast<double>(whole) > seconds) --whole;
-  const std::chrono::seconds since{whole};
-  const auto day = std::chrono::floor<std::chrono::days>(since);
-  const std::chrono::year_month_day date{kDayZero + day};
-  const std::int64_t second = (since - day).count();
-  to = digits(to, int{date.year()}, 4);
-  *to++ = '-';
-  to = digits(to, unsigned{date.month()}, 2);
-  *to++ = '-';
-  to = digits(to, unsigned{date.day()}, 2);
-  *to++ = 'T';
-  to = digits(to, second / 3600, 2);
-  *to++ = ':';
-  to = digits(to, second / 60 % 60, 2);
-  *to++ = ':';
-  to = digits(to, second % 60, 2);
-  *to++ = 'Z';
-  return to;
 }
 
 std::uint64_t escapedSize(const Node& text) noexcept {
@@ -159,6 +104,8 @@ class Writer {
     cursor_ += depth_;
   }
   void text(const Node& node);
+  void plainText(const char*& from, const char* pieceBegin, const char* pieceEnd);
+  void character(const char* from, const char* end);
   void data(const Node& node);
   void scalar(const Node& node);
   void keyElement(const Node& node);
@@ -200,50 +147,53 @@ void Writer::text(const Node& node) {
     const char* const pieceEnd = static_cast<std::size_t>(end - from) > kPiece ? from + kPiece : end;
     reserve(kPiece * kLongestReference + 8);
     const char* const pieceBegin = from;
-    char* to = cursor_;
     while (from < pieceEnd) {
-      while (pieceEnd - from >= 8) {
-        const std::uint64_t word = load64(from);
-        if (!allPlain(word)) break;
-        std::memcpy(to, &word, sizeof word);
-        from += 8;
-        to += 8;
-      }
-      // The last few bytes go together with some before them, which, being plain, stand before `to` already.
-      if (const auto left = pieceEnd - from; left < 8 && pieceEnd - pieceBegin >= 8) {
-        if (const std::uint64_t word = load64(pieceEnd - 8); allPlain(word)) {
-          std::memcpy(to + left - 8, &word, sizeof word);
-          to += left;
-          from = pieceEnd;
-        }
-      }
-      for (int i = 0; i < 8 && from < pieceEnd; ++i, ++from) {
-        const std::uint8_t kind = kByteClasses[static_cast<unsigned char>(*from)];
-        if (kind == plain) {
-          *to++ = *from;
-        } else if (kind == lookAhead) {
-          if (end - from >= 3 && isNonCharacter(from)) failed_ = true;
-          *to++ = *from;
-        } else if (kind == forbidden) {
-          failed_ = true;
-        } else {
-          std::memcpy(to, kReferences[kind].data(), kReferences[kind].size());
-          to += kReferences[kind].size();
-        }
-      }
+      plainText(from, pieceBegin, pieceEnd);
+      for (int i = 0; i < 8 && from < pieceEnd; ++i, ++from) character(from, end);
     }
-    cursor_ = to;
   }
+}
+
+// Copies as much as can be copied eight bytes at a time.
+void Writer::plainText(const char*& from, const char* pieceBegin, const char* pieceEnd) {
+  char* to = cursor_;
+  while (pieceEnd - from >= 8) {
+    const std::uint64_t word = load64(from);
+    if (!allPlain(word)) break;
+    std::memcpy(to, &word, sizeof word);
+    from += 8;
+    to += 8;
+  }
+  // The last few bytes go together with some before them, which, being plain, stand before `to` already.
+  if (const auto left = pieceEnd - from; left < 8 && pieceEnd - pieceBegin >= 8) {
+    if (const std::uint64_t word = load64(pieceEnd - 8); allPlain(word)) {
+      std::memcpy(to + left - 8, &word, sizeof word);
+      to += left;
+      from = pieceEnd;
+    }
+  }
+  cursor_ = to;
+}
+
+void Writer::character(const char* from, const char* end) {
+  const std::uint8_t kind = kByteClasses[static_cast<unsigned char>(*from)];
+  if (kind >= ampersand && kind <= carriageReturn) {
+    std::memcpy(cursor_, kReferences[kind].data(), kReferences[kind].size());
+    cursor_ += kReferences[kind].size();
+    return;
+  }
+  if (kind == forbidden || (kind == lookAhead && end - from >= 3 && isNonCharacter(from))) failed_ = true;
+  *cursor_++ = *from;
 }
 
 void Writer::data(const Node& node) {
   put("<data>\n");
-  const auto* from = reinterpret_cast<const unsigned char*>(node.text);
+  const char* from = node.text;
   for (std::size_t left = node.size; left != 0 && !failed_;) {
     const std::size_t line = left < kDataBytesPerLine ? left : kDataBytesPerLine;
     reserve(kElementRoom);
     indent();
-    cursor_ = encodeLine(from, line, cursor_);
+    cursor_ = encodeBase64(from, line, cursor_);
     *cursor_++ = '\n';
     from += line;
     left -= line;
@@ -392,7 +342,7 @@ XmlExtent xmlExtentOf(const Node& node) noexcept {
       return {node.integer != 0 ? std::uint64_t{8} : std::uint64_t{9}, 1};
     case Tag::data: {
       const std::uint64_t lines = (std::uint64_t{node.size} + kDataBytesPerLine - 1) / kDataBytesPerLine;
-      return {15 + (std::uint64_t{node.size} + 2) / 3 * 4 + lines, 2 + lines};
+      return {15 + base64Size(node.size) + lines, 2 + lines};
     }
     case Tag::array:
       return {9, 1};

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/plist/Document.h"
+#include "platform/plist/internal/Document.h"
 
 #include <sys/random.h>
 
@@ -60,6 +60,45 @@ const Node* probe(const Node* pairs, const std::uint32_t* index, std::size_t slo
   return nullptr;
 }
 
+// Drops earlier values of equal keys in a dictionary without an index. Returns the number of entries left.
+std::size_t dropRepeatsBySearch(Node* pairs, std::size_t entries) noexcept {
+  std::size_t kept = 0;
+  // One bit a hash: most dictionaries have no two keys with the same one, and are not searched at all.
+  std::uint64_t seen = 0;
+  for (std::size_t i = 0; i < entries; ++i) {
+    const Node& key = pairs[2 * i];
+    const std::uint64_t bit = std::uint64_t{1} << (key.hash[0] & 63);
+    std::size_t place = (seen & bit) != 0 ? 0 : kept;
+    while (place < kept && !sameKey(pairs[2 * place], key)) ++place;
+    seen |= bit;
+    if (place == kept) pairs[2 * kept++] = key;
+    pairs[2 * place + 1] = pairs[2 * i + 1];
+  }
+  return kept;
+}
+
+// The same, making the index behind the entries.
+std::size_t dropRepeatsByIndex(Node* pairs, std::size_t entries) noexcept {
+  auto* const index = reinterpret_cast<std::uint32_t*>(pairs + 2 * entries);
+  const std::size_t slots = indexSlots(entries);
+  std::fill_n(index, slots, 0u);
+  std::size_t kept = 0;
+  for (std::size_t i = 0; i < entries; ++i) {
+    std::size_t slot = 0;
+    const Node* const earlier = probe(pairs, index, slots, pairs[2 * i], slot);
+    if (earlier != nullptr) {
+      pairs[earlier - pairs + 1] = pairs[2 * i + 1];
+      continue;
+    }
+    if (i != kept) {
+      pairs[2 * kept] = pairs[2 * i];
+      pairs[2 * kept + 1] = pairs[2 * i + 1];
+    }
+    index[slot] = static_cast<std::uint32_t>(++kept);
+  }
+  return kept;
+}
+
 }  // namespace
 
 std::uint64_t hashOf(const char* bytes, std::size_t size) noexcept {
@@ -91,46 +130,11 @@ std::size_t dictionaryBytes(std::size_t entries) noexcept {
 Node finishDictionary(Node* pairs, std::size_t entries) noexcept {
   std::size_t kept = 0;
   if (entries <= kLargestUnindexed) {
-    // One bit a hash: most dictionaries have no two keys with the same one, and are not searched at all.
-    std::uint64_t seen = 0;
-    for (std::size_t i = 0; i < entries; ++i) {
-      const Node& key = pairs[2 * i];
-      const std::uint64_t bit = std::uint64_t{1} << (key.hash[0] & 63);
-      std::size_t place = kept;
-      if ((seen & bit) != 0) {
-        for (place = 0; place < kept && !sameKey(pairs[2 * place], key); ++place) {
-        }
-      }
-      seen |= bit;
-      if (place == kept) {
-        if (i != kept) pairs[2 * kept] = key;
-        ++kept;
-      }
-      if (place != i) pairs[2 * place + 1] = pairs[2 * i + 1];
-    }
+    kept = dropRepeatsBySearch(pairs, entries);
   } else {
-    auto build = [pairs, &kept](std::size_t from) {
-      auto* const index = reinterpret_cast<std::uint32_t*>(pairs + 2 * from);
-      const std::size_t slots = indexSlots(from);
-      std::fill_n(index, slots, 0u);
-      kept = 0;
-      for (std::size_t i = 0; i < from; ++i) {
-        std::size_t slot = 0;
-        const Node* const earlier = probe(pairs, index, slots, pairs[2 * i], slot);
-        if (earlier != nullptr) {
-          pairs[earlier - pairs + 1] = pairs[2 * i + 1];
-          continue;
-        }
-        if (i != kept) {
-          pairs[2 * kept] = pairs[2 * i];
-          pairs[2 * kept + 1] = pairs[2 * i + 1];
-        }
-        index[slot] = static_cast<std::uint32_t>(++kept);
-      }
-    };
-    build(entries);
+    kept = dropRepeatsByIndex(pairs, entries);
     // The index is found by the number of entries, so with fewer of them it has another place.
-    if (kept != entries && kept > kLargestUnindexed) build(kept);
+    if (kept != entries && kept > kLargestUnindexed) dropRepeatsByIndex(pairs, kept);
   }
   Node dictionary;
   dictionary.tag = Tag::dictionary;

@@ -1,10 +1,10 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/plist/XmlEncoding.h"
+#include "platform/plist/internal/XmlEncoding.h"
 
 #include <algorithm>
 
-#include "platform/plist/Text.h"
+#include "platform/plist/internal/Text.h"
 
 namespace brenvik::plist {
 namespace {

@@ -1,6 +1,6 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/preferences/linux/DomainImage.h"
+#include "platform/plist/EditableDictionary.h"
 
 #include <gtest/gtest.h>
 
@@ -17,12 +17,12 @@ namespace {
 
 PropertyList parse(std::string_view bytes) { return parsePropertyList(std::as_bytes(std::span(bytes))); }
 
-std::string contentOf(DomainImage& image) {
-  const auto pieces = image.content();
+std::string contentOf(EditableDictionary& edited) {
+  const auto pieces = edited.content();
   return std::string(pieces[0]) + std::string(pieces[1]);
 }
 
-PropertyList written(DomainImage& image) { return parse(contentOf(image)); }
+PropertyList written(EditableDictionary& edited) { return parse(contentOf(edited)); }
 
 PropertyList dictionaryOf(const std::map<std::string, PropertyList>& model) {
   return PropertyList::dictionary({model.begin(), model.end()});
@@ -35,30 +35,30 @@ PropertyList numbers(std::size_t count) {
   return PropertyList::array(std::move(elements));
 }
 
-TEST(DomainImageTest, AnEmptyImageIsAnEmptyDictionary) {
-  DomainImage image;
-  EXPECT_EQ(written(image), PropertyList::dictionary({}));
-  EXPECT_FALSE(image.find("key"));
-  EXPECT_EQ(image.set("key", {}), DomainImage::Change::none);
+TEST(EditableDictionaryTest, AnEmptyImageIsAnEmptyDictionary) {
+  EditableDictionary edited;
+  EXPECT_EQ(written(edited), PropertyList::dictionary({}));
+  EXPECT_FALSE(edited.find("key"));
+  EXPECT_EQ(edited.set("key", {}), EditableDictionary::Change::none);
 }
 
-TEST(DomainImageTest, OnlyADictionaryBecomesAnImage) {
-  EXPECT_FALSE(DomainImage::of({}));
-  EXPECT_FALSE(DomainImage::of(PropertyList::array({})));
-  EXPECT_FALSE(DomainImage::of(PropertyList::string("text")));
+TEST(EditableDictionaryTest, OnlyADictionaryBecomesAnImage) {
+  EXPECT_FALSE(EditableDictionary::of({}));
+  EXPECT_FALSE(EditableDictionary::of(PropertyList::array({})));
+  EXPECT_FALSE(EditableDictionary::of(PropertyList::string("text")));
 }
 
-TEST(DomainImageTest, SettingWhatStandsAlreadyChangesNothing) {
-  DomainImage image;
+TEST(EditableDictionaryTest, SettingWhatStandsAlreadyChangesNothing) {
+  EditableDictionary edited;
   for (const auto& value : {PropertyList::string("text"), numbers(20), PropertyList::dictionary({})}) {
-    EXPECT_EQ(image.set("key", value), DomainImage::Change::made);
-    EXPECT_EQ(image.set("key", value), DomainImage::Change::none);
+    EXPECT_EQ(edited.set("key", value), EditableDictionary::Change::made);
+    EXPECT_EQ(edited.set("key", value), EditableDictionary::Change::none);
   }
 }
 
 // Every way an entry can change its size and its number of objects, at random, against a plain map: with few
 // keys, and with enough of them to pass the limits at which references take two and four bytes.
-TEST(DomainImageTest, AfterAnyChangesItHoldsWhatAMapWouldHold) {
+TEST(EditableDictionaryTest, AfterAnyChangesItHoldsWhatAMapWouldHold) {
   std::mt19937 random(20240229);
   const auto below = [&random](std::size_t limit) { return random() % limit; };
   const auto anyValue = [&]() -> PropertyList {
@@ -89,132 +89,132 @@ TEST(DomainImageTest, AfterAnyChangesItHoldsWhatAMapWouldHold) {
     int changes;
   } runs[] = {{5, 400}, {100, 600}, {300, 1500}};
   for (const auto& run : runs) {
-    DomainImage image;
+    EditableDictionary edited;
     std::map<std::string, PropertyList> model;
     for (int i = 0; i < run.changes; ++i) {
       std::string key = (below(5) == 0 ? "\xC3\xA9" : "key ") + std::to_string(below(run.keys));
       const PropertyList value = anyValue();
-      ASSERT_NE(image.set(key, value), DomainImage::Change::refused);
+      ASSERT_NE(edited.set(key, value), EditableDictionary::Change::refused);
       if (value) {
         model[key] = value;
       } else {
         model.erase(key);
       }
-      ASSERT_EQ(image.size(), model.size());
-      ASSERT_EQ(image.find(key), value);
+      ASSERT_EQ(edited.size(), model.size());
+      ASSERT_EQ(edited.find(key), value);
       if (i % 50 != 0) continue;
-      ASSERT_EQ(written(image), dictionaryOf(model));
-      for (const auto& [name, expected] : model) ASSERT_EQ(image.find(name), expected) << name;
+      ASSERT_EQ(written(edited), dictionaryOf(model));
+      for (const auto& [name, expected] : model) ASSERT_EQ(edited.find(name), expected) << name;
       // And from a file like this one, too.
-      if (i % 200 == 0) image = *DomainImage::of(written(image));
+      if (i % 200 == 0) edited = *EditableDictionary::of(written(edited));
     }
-    EXPECT_EQ(written(image), dictionaryOf(model));
+    EXPECT_EQ(written(edited), dictionaryOf(model));
   }
 }
 
-TEST(DomainImageTest, ReferencesGrowWithTheNumberOfObjects) {
-  DomainImage image;
+TEST(EditableDictionaryTest, ReferencesGrowWithTheNumberOfObjects) {
+  EditableDictionary edited;
   std::map<std::string, PropertyList> model;
   model["nested"] = PropertyList::array({numbers(3), PropertyList::dictionary({{"a", numbers(2)}})});
-  ASSERT_EQ(image.set("nested", model["nested"]), DomainImage::Change::made);
+  ASSERT_EQ(edited.set("nested", model["nested"]), EditableDictionary::Change::made);
   for (int i = 0; i < 33'000; ++i) {
     const std::string key = "key" + std::to_string(i);
     model[key] = PropertyList::integer(i);
-    ASSERT_EQ(image.set(key, model[key]), DomainImage::Change::made);
+    ASSERT_EQ(edited.set(key, model[key]), EditableDictionary::Change::made);
     // One object on the file's end, two for each entry: 256 and 65,536 objects are passed on the way.
     if ((i > 100 && i < 140) || (i > 32'745 && i < 32'775)) {
-      ASSERT_EQ(image.find("nested"), model["nested"]) << i;
+      ASSERT_EQ(edited.find("nested"), model["nested"]) << i;
       if (i < 140 || i % 8 == 0) {
-        ASSERT_EQ(written(image), dictionaryOf(model)) << i;
+        ASSERT_EQ(written(edited), dictionaryOf(model)) << i;
       }
     }
   }
-  EXPECT_EQ(written(image), dictionaryOf(model));
+  EXPECT_EQ(written(edited), dictionaryOf(model));
   model["nested"] = numbers(1);
-  ASSERT_EQ(image.set("nested", model["nested"]), DomainImage::Change::made);
+  ASSERT_EQ(edited.set("nested", model["nested"]), EditableDictionary::Change::made);
   model.erase("key7");
-  ASSERT_EQ(image.set("key7", {}), DomainImage::Change::made);
-  EXPECT_EQ(written(image), dictionaryOf(model));
+  ASSERT_EQ(edited.set("key7", {}), EditableDictionary::Change::made);
+  EXPECT_EQ(written(edited), dictionaryOf(model));
 }
 
-TEST(DomainImageTest, PartsSharedBetweenEntriesArePartedAndPartsSharedWithinOneAreNot) {
+TEST(EditableDictionaryTest, PartsSharedBetweenEntriesArePartedAndPartsSharedWithinOneAreNot) {
   const PropertyList shared = numbers(50);
   std::vector<std::pair<std::string, PropertyList>> entries;
   for (int i = 0; i < 100; ++i)
     entries.emplace_back("k" + std::to_string(i), PropertyList::array({shared, shared, shared}));
   const auto document = PropertyList::dictionary(entries);
-  auto image = DomainImage::of(parse(*serializePropertyList(document, PropertyListFormat::binary)));
-  ASSERT_TRUE(image);
-  EXPECT_EQ(written(*image), document);
-  ASSERT_EQ(image->set("k5", PropertyList::integer(1)), DomainImage::Change::made);
-  EXPECT_EQ(image->find("k6"), entries[6].second);
+  auto edited = EditableDictionary::of(parse(*serializePropertyList(document, PropertyListFormat::binary)));
+  ASSERT_TRUE(edited);
+  EXPECT_EQ(written(*edited), document);
+  ASSERT_EQ(edited->set("k5", PropertyList::integer(1)), EditableDictionary::Change::made);
+  EXPECT_EQ(edited->find("k6"), entries[6].second);
 
   // A quarter of a million elements if sharing were lost.
   PropertyList doubled = PropertyList::array({PropertyList::boolean(true)});
   for (int i = 0; i < 18; ++i) doubled = PropertyList::array({doubled, doubled});
-  ASSERT_EQ(image->set("doubled", doubled), DomainImage::Change::made);
-  EXPECT_LT(contentOf(*image).size(), 100'000u);
-  EXPECT_EQ(image->find("doubled"), doubled);
+  ASSERT_EQ(edited->set("doubled", doubled), EditableDictionary::Change::made);
+  EXPECT_LT(contentOf(*edited).size(), 100'000u);
+  EXPECT_EQ(edited->find("doubled"), doubled);
 }
 
-TEST(DomainImageTest, AValueIsRefusedThatWouldMakeTheDomainUnreadable) {
-  DomainImage image;
-  ASSERT_EQ(image.set("stays", PropertyList::string("here")), DomainImage::Change::made);
+TEST(EditableDictionaryTest, AValueIsRefusedThatWouldMakeTheDomainUnreadable) {
+  EditableDictionary edited;
+  ASSERT_EQ(edited.set("stays", PropertyList::string("here")), EditableDictionary::Change::made);
   PropertyList deep = PropertyList::integer(1);
   for (std::size_t i = 0; i < kMaxPropertyListDepth - 1; ++i) deep = PropertyList::array({deep});
-  EXPECT_EQ(image.set("deep", deep), DomainImage::Change::made);
-  EXPECT_TRUE(written(image)) << "just as deep as can be read";
-  EXPECT_EQ(image.set("deeper", PropertyList::array({deep})), DomainImage::Change::refused);
-  EXPECT_EQ(image.set("large", PropertyList::string(std::string(kLargestDomain, 'x'))),
-            DomainImage::Change::refused);
-  EXPECT_EQ(image.set("stays", PropertyList::string(std::string(kLargestDomain, 'x'))),
-            DomainImage::Change::refused);
-  EXPECT_EQ(image.set("\xC0", PropertyList::integer(1)), DomainImage::Change::refused);
-  EXPECT_EQ(written(image),
+  EXPECT_EQ(edited.set("deep", deep), EditableDictionary::Change::made);
+  EXPECT_TRUE(written(edited)) << "just as deep as can be read";
+  EXPECT_EQ(edited.set("deeper", PropertyList::array({deep})), EditableDictionary::Change::refused);
+  EXPECT_EQ(edited.set("large", PropertyList::string(std::string(EditableDictionary::kMaxFileSize, 'x'))),
+            EditableDictionary::Change::refused);
+  EXPECT_EQ(edited.set("stays", PropertyList::string(std::string(EditableDictionary::kMaxFileSize, 'x'))),
+            EditableDictionary::Change::refused);
+  EXPECT_EQ(edited.set("\xC0", PropertyList::integer(1)), EditableDictionary::Change::refused);
+  EXPECT_EQ(written(edited),
             PropertyList::dictionary({{"stays", PropertyList::string("here")}, {"deep", deep}}));
 }
 
-TEST(DomainImageTest, AnEmptyContainerIsALevelToo) {
+TEST(EditableDictionaryTest, AnEmptyContainerIsALevelToo) {
   for (const PropertyList& empty : {PropertyList::array({}), PropertyList::dictionary({})}) {
-    DomainImage image;
+    EditableDictionary edited;
     PropertyList deep = empty;
     for (std::size_t i = 1; i < kMaxPropertyListDepth - 1; ++i) deep = PropertyList::array({deep});
-    EXPECT_EQ(image.set("deep", deep), DomainImage::Change::made);
-    EXPECT_TRUE(written(image)) << "just as deep as can be read";
-    EXPECT_EQ(image.set("deeper", PropertyList::array({deep})), DomainImage::Change::refused);
-    EXPECT_TRUE(written(image)) << "still";
+    EXPECT_EQ(edited.set("deep", deep), EditableDictionary::Change::made);
+    EXPECT_TRUE(written(edited)) << "just as deep as can be read";
+    EXPECT_EQ(edited.set("deeper", PropertyList::array({deep})), EditableDictionary::Change::refused);
+    EXPECT_TRUE(written(edited)) << "still";
   }
 }
 
-TEST(DomainImageTest, EntriesThatAreLegalAloneAreRefusedWhenTheirXmlFormTogetherPassesTheLimit) {
+TEST(EditableDictionaryTest, EntriesThatAreLegalAloneAreRefusedWhenTheirXmlFormTogetherPassesTheLimit) {
   // More than ten MiB as XML, some hundred bytes here.
   PropertyList expanding = PropertyList::array({PropertyList::boolean(true)});
   for (int i = 0; i < 17; ++i) expanding = PropertyList::array({expanding, expanding});
-  DomainImage image;
+  EditableDictionary edited;
   std::map<std::string, PropertyList> model;
   int accepted = 0;
   for (int i = 0; i < 8; ++i) {
     const std::string key = "key" + std::to_string(i);
-    if (image.set(key, expanding) == DomainImage::Change::refused) continue;
+    if (edited.set(key, expanding) == EditableDictionary::Change::refused) continue;
     ++accepted;
     model[key] = expanding;
   }
   EXPECT_GE(accepted, 1);
   EXPECT_LT(accepted, 8);
-  EXPECT_EQ(written(image), dictionaryOf(model));
+  EXPECT_EQ(written(edited), dictionaryOf(model));
   // What was refused changed nothing, and smaller things still fit.
-  EXPECT_EQ(image.set("small", PropertyList::integer(1)), DomainImage::Change::made);
-  EXPECT_EQ(image.find("small").asInteger(), 1);
-  EXPECT_TRUE(written(image));
+  EXPECT_EQ(edited.set("small", PropertyList::integer(1)), EditableDictionary::Change::made);
+  EXPECT_EQ(edited.find("small").asInteger(), 1);
+  EXPECT_TRUE(written(edited));
 }
 
-TEST(DomainImageTest, SettingOneLargeValueAgainAndAgainDoesNotUseUpTheLimit) {
-  DomainImage image;
+TEST(EditableDictionaryTest, SettingOneLargeValueAgainAndAgainDoesNotUseUpTheLimit) {
+  EditableDictionary edited;
   for (int i = 0; i < 40; ++i) {
     const std::string text(2'000'000, static_cast<char>('a' + i % 26));
-    ASSERT_EQ(image.set("key", PropertyList::string(text)), DomainImage::Change::made) << i;
+    ASSERT_EQ(edited.set("key", PropertyList::string(text)), EditableDictionary::Change::made) << i;
   }
-  EXPECT_EQ(image.find("key").asString()->size(), 2'000'000u);
+  EXPECT_EQ(edited.find("key").asString()->size(), 2'000'000u);
 }
 
 }  // namespace

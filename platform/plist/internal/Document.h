@@ -12,7 +12,7 @@
 #include "platform/plist/Node.h"
 #include "platform/plist/PropertyList.h"
 
-// Internal to this folder. Functions here throw std::bad_alloc; the public ones catch it.
+// Functions here throw std::bad_alloc; the public ones catch it.
 namespace brenvik::plist {
 
 struct Foreign {

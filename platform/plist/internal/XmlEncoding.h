@@ -6,7 +6,6 @@
 #include <string>
 #include <string_view>
 
-// Internal to this folder.
 namespace brenvik::plist {
 
 // What the bytes of a document are encoded in, as far as their beginning tells.

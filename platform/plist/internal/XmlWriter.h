@@ -6,9 +6,8 @@
 #include <string>
 
 #include "platform/plist/Node.h"
-#include "platform/plist/XmlSize.h"
+#include "platform/plist/internal/XmlSize.h"
 
-// Internal to this folder.
 namespace brenvik::plist {
 
 // Nothing when beyond a limit or when XML cannot carry a character or a date. Throws std::bad_alloc.

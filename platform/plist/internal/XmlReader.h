@@ -6,7 +6,6 @@
 
 #include "platform/plist/PropertyList.h"
 
-// Internal to this folder.
 namespace brenvik::plist {
 
 // Reads the property-list grammar (XML 1.0 in UTF-8, in US-ASCII where declared, or in UTF-16 with its

@@ -6,7 +6,7 @@
 #include <cstdint>
 #include <cstring>
 
-// Internal to this folder: what both readers do with texts.
+// What both readers do with texts.
 namespace brenvik::plist {
 
 inline bool isAscii(const char* bytes, std::size_t size) noexcept {

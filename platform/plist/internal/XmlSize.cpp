@@ -1,12 +1,12 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
-#include "platform/plist/XmlSize.h"
+#include "platform/plist/internal/XmlSize.h"
 
 #include <unordered_map>
 #include <vector>
 
-#include "platform/plist/Document.h"
-#include "platform/plist/XmlWriter.h"
+#include "platform/plist/internal/Document.h"
+#include "platform/plist/internal/XmlWriter.h"
 
 namespace brenvik::plist {
 
