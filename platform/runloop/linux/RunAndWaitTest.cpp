@@ -27,7 +27,7 @@ class QueueShortOfMemory final : public WorkQueue {
     return nullptr;
   }
   bool isCurrent() const noexcept override { return queue_.isCurrent(); }
-  std::unique_ptr<DescriptorSource> watchDescriptor(int, std::uint32_t, RunLoop::DescriptorHandler) override {
+  std::unique_ptr<DescriptorSource> watchDescriptor(int, Interest, RunLoop::DescriptorHandler) override {
     return nullptr;
   }
 
