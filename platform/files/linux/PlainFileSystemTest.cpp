@@ -28,10 +28,7 @@ std::function<void(const char*)> beforeOpening;  // NOLINT
 
 }  // namespace
 
-// Only the symbol has the C library's name: its headers define a function openat() where they check sizes
-// (_FORTIFY_SOURCE).
-extern "C" int watchedOpenat(int directory, const char* path, int flags, ...) __asm__("openat");
-extern "C" int watchedOpenat(int directory, const char* path, int flags, ...) {
+extern "C" int openat(int directory, const char* path, int flags, ...) {
   if (beforeOpening && (flags & (O_DIRECTORY | O_PATH)) == O_DIRECTORY) beforeOpening(path);
   const bool isUnnamed = (flags & O_TMPFILE) == O_TMPFILE;
   if (isUnnamed && brenvik::FailingCall::failsNow("openat(O_TMPFILE)")) return -1;
