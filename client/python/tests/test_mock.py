@@ -561,7 +561,9 @@ class Completions(unittest.TestCase):
         if shutil.which("fish"):
             done = subprocess.run(["fish", "--no-config", "-c", "source $argv[1]; complete -C 'brenvik-mobile-helper-mock --re'",
                                    folder / "fish"], capture_output=True, text=True, check=True)
-            self.assertEqual([line.split("\t")[0] for line in done.stdout.splitlines()], ["--record"])
+            # From version 4 on it offers after them what has the letters elsewhere.
+            offered = [line.split("\t")[0] for line in done.stdout.splitlines()]
+            self.assertEqual([each for each in offered if each.startswith("--re")], ["--record"])
         if shutil.which("zsh"):
             subprocess.run(["zsh", "-n", folder / "zsh"], check=True)
 
