@@ -247,7 +247,7 @@ class AllocationsTest(HelperTest):
     def expect_closing_thread(self, request, when):
         """What an answer of a worker carries and lack of memory drops is closed by a thread, which starts then and stays."""
         before = self.held
-        if self.daemon.threads().count("closing") == before[2].count("closing"):
+        if before is None or self.daemon.threads().count("closing") == before[2].count("closing"):
             return
         more = self.forgiven + CLOSING_THREAD_BLOCKS
         self.hold(request)
