@@ -26,6 +26,7 @@ class HelperStatusTest : public testing::Test {
   void clientGoes() { sources.deathWatches.back()->tellDeath(); }
 
   ManualClock clock;
+  std::chrono::nanoseconds late{0};  // how far the run loop is behind the time
   ManualRunLoop loop{clock};
   FakePortSpace ports;
   FakeBootstrap bootstrap{ports};
@@ -37,7 +38,7 @@ class HelperStatusTest : public testing::Test {
                           .loop = loop,
                           .hasEntitlement = [](const char*, const AuditToken&) { return true; },
                           .registry = registry,
-                          .now = [this] { return clock.now(); }};
+                          .now = [this] { return clock.now() + late; }};
   NoRoutines routines;
   RecordingLog log;
   std::unique_ptr<ServerContext> server = CreateServer(platform, kServiceName, routines);
@@ -103,6 +104,20 @@ TEST_F(HelperStatusTest, AHostedServerThatIsBusyIsNamedAndTheCountdownBeginsAnew
   EXPECT_EQ(told.leavesIn, 10000ms);
   clientComes();
   EXPECT_FALSE(status.report().isKeptByBaseband);
+}
+
+TEST_F(HelperStatusTest, ATickThatIsDueAndHasNotComeLeavesNoTime) {
+  SetIdleCheck(server.get(), [] { return true; });
+  clientComes();
+  clientGoes();
+  for (int tick = 0; tick < 2; ++tick) {
+    clock.advance(9990ms);
+    late = 50ms;
+    EXPECT_EQ(status.report().leavesIn, 0ms);
+    late = 0ms;
+    clock.advance(10ms);
+    EXPECT_EQ(status.report().leavesIn, 10000ms);
+  }
 }
 
 TEST_F(HelperStatusTest, HowLocationRequestsEndedIsToldWithoutAnyPlace) {

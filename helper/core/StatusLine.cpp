@@ -26,9 +26,14 @@ void StatusLine::changed() noexcept {
     queues_.main().post([weak = std::weak_ptr(self_)] {
       const auto self = weak.lock();
       if (self == nullptr) return;
-      (*self)->queues_.main().postAfter(kPause, [weak] {
-        if (const auto alive = weak.lock()) (*alive)->show();
-      });
+      try {
+        (*self)->queues_.main().postAfter(kPause, [weak] {
+          if (const auto alive = weak.lock()) (*alive)->show();
+        });
+      } catch (const std::bad_alloc&) {
+        (*self)->isUnderWay_ = false;
+        throw;
+      }
     });
   } catch (const std::bad_alloc&) {
     isUnderWay_ = false;  // the next change tries again

@@ -5,9 +5,11 @@
 #include <gtest/gtest.h>
 
 #include <memory>
+#include <new>
 #include <string>
 #include <vector>
 
+#include "platform/base/fakes/FailingAllocations.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
 #include "platform/servicemanager/fakes/RecordingServiceManager.h"
 
@@ -70,6 +72,20 @@ TEST_F(StatusLineTest, WithoutAServiceManagerNothingIsDone) {
   manager.isListening = false;
   line->changed();
   EXPECT_EQ(queues.main().pending(), 0U);
+}
+
+TEST_F(StatusLineTest, AChangeThatIsLostForLackOfMemoryIsShownWithTheNextOne) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "nothing fails under this sanitizer";
+  line->changed();
+  {
+    const FailingAllocations failing(0);
+    EXPECT_THROW(queues.main().runReady(), std::bad_alloc);
+  }
+  pass(1s);
+  EXPECT_TRUE(manager.lines.empty());
+  line->changed();
+  pass(1s);
+  EXPECT_EQ(manager.lines, std::vector<std::string>{"first"});
 }
 
 TEST_F(StatusLineTest, WhatIsUnderWayWhenItEndsIsForgotten) {

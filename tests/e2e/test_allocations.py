@@ -37,6 +37,7 @@ from test_location import PARIS, STUN, Brenvik, GeocoderTest, WanIpTest, address
 EVERY = "BRENVIK_EVERY_ALLOCATION" in os.environ
 MOST_PROBLEMS = 20
 MOST_LOST_BY_A_LIBRARY = 4
+CLOSING_THREAD_BLOCKS = 2  # its list of accounts, and what the C library keeps for a thread
 REFUSED_AT_ONCE = 50  # check-ins of one account; any more wait
 LAST_DEADLY = 5  # of a location request: what queues it comes first
 OUT_OF_MEMORY = (3, 6)
@@ -241,6 +242,18 @@ class AllocationsTest(HelperTest):
             self.problem(f"{when}, again: {self.difference(request.state(), new)}{who()}")
         if request.leaky:
             self.forgive(request.leaky, who)
+        self.expect_closing_thread(request, when)
+
+    def expect_closing_thread(self, request, when):
+        """What an answer of a worker carries and lack of memory drops is closed by a thread, which starts then and stays."""
+        before = self.held
+        if before is None or self.daemon.threads().count("closing") == before[2].count("closing"):
+            return
+        more = self.forgiven + CLOSING_THREAD_BLOCKS
+        self.hold(request)
+        if (sorted([*before[2], "closing"]) != sorted(self.held[2]) or self.held[1] != before[1]
+                or self.held[0] - before[0] > more):
+            self.problem(f"{when}: holds {self.held} with the closing thread, before {before} and {more} more blocks at most")
 
     def forgive(self, library, who):
         for _ in range(100):

@@ -184,13 +184,15 @@ void ServerContext::idleTimerTick() {
   }
   const Locked lock(*this);
   isKeptByIdleCheck_ = true;
+  const auto period = platform_.idlePeriod;
+  nextIdleTick_ += period * ((platform_.now() - nextIdleTick_) / period + 1);
 }
 
 void ServerContext::armIdleTimerIfIdle(Locked& lock) {
   if (busyMask_ != 0 || !clients_.empty() || idleTimer_ != nullptr) return;
-  idleSince_ = platform_.now();
-  isKeptByIdleCheck_ = false;
   const std::chrono::nanoseconds period = platform_.idlePeriod;
+  nextIdleTick_ = platform_.now() + period;
+  isKeptByIdleCheck_ = false;
   try {
     idleTimer_ = platform_.loop.addTimer(
         period, period, [this] { idleTimerTick(); }, [this] { stop(); });
@@ -264,8 +266,7 @@ ServerFacts ServerContext::facts() const {
     }
   }
   if (idleTimer_ == nullptr) return facts;
-  const auto period = platform_.idlePeriod;
-  facts.leavesIn = period - (platform_.now() - idleSince_) % period;
+  facts.leavesIn = std::max(nextIdleTick_ - platform_.now(), std::chrono::nanoseconds::zero());
   facts.isKeptByIdleCheck = isKeptByIdleCheck_;
   return facts;
 }

@@ -113,7 +113,7 @@ class ServerContext {
   std::map<const DeathWatch*, std::unique_ptr<Client>> clients_;
   std::uint32_t busyMask_ = 0;
   std::array<const char*, 32> busyReasons_{};  // of the bits that are set
-  std::chrono::nanoseconds idleSince_{0};      // when the idle timer was armed
+  std::chrono::nanoseconds nextIdleTick_{0};   // when the idle timer fires next
   bool isKeptByIdleCheck_ = false;             // the check's last answer
 
   std::atomic<bool> isStopped_{false};  // looked at after each request, where a lock would cost time

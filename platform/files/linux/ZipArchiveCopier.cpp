@@ -44,15 +44,27 @@ std::string findReader() {
   return ::access(installed.c_str(), X_OK) == 0 ? installed : std::string();
 }
 
-// A destination that is not there: the first directory on its way that has to be made, and the names below
-// it.
-struct MissingPath {
+// 0 or errno: EINVAL for what is no regular file.
+int openArchive(const std::string& path, UniqueFd* archive) {
+  // O_NONBLOCK: a FIFO would hold the main loop until somebody writes.
+  if (const int error = openToRead(path, O_RDONLY | O_NONBLOCK | O_NOCTTY, archive); error != 0) return error;
+  struct stat info {};
+  if (::fstat(archive->get(), &info) != 0) return errno;
+  return S_ISREG(info.st_mode) ? 0 : EINVAL;
+}
+
+// Where the archive goes. The stage stands in place.directory, on the file system of the destination: inside
+// a destination that is there, else beside the first directory on its way that has to be made.
+struct Destination {
+  UniqueFd existing;  // the destination, when it is there
   Place place;
-  std::vector<std::string> below;
+  std::vector<std::string>
+      below;  // what has to be made below the place, so that a failure leaves none behind
 };
 
-// 0 or errno: EEXIST for a path with ".." in its missing part, which leads nowhere that can be made.
-int findMissing(std::string path, MissingPath* missing) {
+// For a destination that is not there. 0 or errno: EEXIST for a path with ".." in its missing part, which
+// leads nowhere that can be made.
+int findMissing(std::string path, Destination* missing) {
   for (;;) {
     while (path.size() > 1 && path.back() == '/') path.pop_back();
     const int error = Place::open(path, &missing->place);
@@ -68,6 +80,15 @@ int findMissing(std::string path, MissingPath* missing) {
   return 0;
 }
 
+// 0 or errno.
+int findDestination(const std::string& path, Destination* found) {
+  const int error = openDirectory(path, &found->place.directory);
+  if (error == ENOENT) return findMissing(path, found);
+  if (error != 0) return error;
+  found->existing.reset(::openat(found->place.directory.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  return found->existing.isValid() ? 0 : errno;
+}
+
 // Makes the names below the directory, one in the other, and opens the last. 0 or errno.
 int makeBelow(int directory, const std::vector<std::string>& names, UniqueFd* last) {
   last->reset(::openat(directory, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
@@ -77,6 +98,22 @@ int makeBelow(int directory, const std::vector<std::string>& names, UniqueFd* la
     if (!last->isValid() || ::fchmod(last->get(), kDirectoryMode) != 0) return errno;
   }
   return last->isValid() ? 0 : errno;
+}
+
+// Both show the finished stage. Before a name shows, what it stands for is on the disk; and the answer waits
+// for the names. 0 or errno.
+int merge(const Stage& stage, int existing) {
+  if (const int error = checkMerge(stage.get(), existing); error != 0) return error;
+  if (const int error = syncFileSystem(stage.get()); error != 0) return error;
+  if (const int error = mergeStaged(stage.get(), existing); error != 0) return error;
+  return syncFileSystem(existing);
+}
+
+int publish(Stage& stage, int directory) {
+  if (::fchmod(stage.get(), kDirectoryMode) != 0) return errno;
+  if (const int error = syncFileSystem(stage.get()); error != 0) return error;
+  if (const int error = stage.publish(IfPresent::fail); error != 0) return error;
+  return syncNames(directory);
 }
 
 // The reader's frames on their way to the writer.
@@ -116,59 +153,37 @@ int ZipArchiveCopier::unpack(const std::string& archive, const std::string& dest
                              const PropertyList& options, bool* wasAnswered) {
   if (!isOn(options, "extractPKZip")) return ENOTSUP;
   const auto deadline = std::chrono::steady_clock::now() + longest_;
-  // O_NONBLOCK: a FIFO would hold the main loop until somebody writes.
   UniqueFd input;
-  struct stat info {};
-  if (const int error = openToRead(archive, O_RDONLY | O_NONBLOCK | O_NOCTTY, &input); error != 0)
-    return error;
-  if (::fstat(input.get(), &info) != 0) return errno;
-  if (!S_ISREG(info.st_mode)) return EINVAL;
+  if (const int error = openArchive(archive, &input); error != 0) return error;
+  Destination target;
+  if (const int error = findDestination(destination, &target); error != 0) return error;
 
-  // Beside a destination that is still to be made, or inside one that is there: on its file system either
-  // way. Directories missing above it are made with it, so that an archive that fails leaves none behind.
-  MissingPath missing;
-  Place& place = missing.place;
-  UniqueFd existing;
-  if (const int error = openDirectory(destination, &place.directory); error == 0) {
-    existing.reset(::openat(place.directory.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!existing.isValid()) return errno;
-  } else {
-    if (error != ENOENT) return error;
-    if (const int failed = findMissing(destination, &missing); failed != 0) return failed;
-  }
-
-  removeLeftovers(place.directory.get());
-  Stage stage(place);
+  removeLeftovers(target.place.directory.get());
+  Stage stage(target.place);
   if (const int error = stage.makeDirectory(); error != 0) return error;
   struct statvfs disk {};
   if (::fstatvfs(stage.get(), &disk) != 0) return errno;
   UniqueFd top;
-  if (const int error = makeBelow(stage.get(), missing.below, &top); error != 0) return error;
+  if (const int error = makeBelow(stage.get(), target.below, &top); error != 0) return error;
   UnpackWriter writer(top.get(), {isOn(options, "copyExtendedAttributes"), isOn(options, "copyResources")},
                       std::uint64_t{disk.f_bavail} * disk.f_frsize, onFileError_);
+  const int error = readInto(writer, input.get(), deadline);
+  *wasAnswered = writer.wasStoppedByAnswer();
+  if (error != 0) return error;
+  return target.existing.isValid() ? merge(stage, target.existing.get())
+                                   : publish(stage, target.place.directory.get());
+}
+
+int ZipArchiveCopier::readInto(UnpackWriter& writer, int archive,
+                               std::chrono::steady_clock::time_point deadline) {
   ArchiveFrameParser parser(writer);
   {
     ReaderProcess reader;
-    if (const int error = reader.start(reader_, input.get()); error != 0) return error;
+    if (const int error = reader.start(reader_, archive); error != 0) return error;
     Unpacking unpacking(parser, writer);
-    const int error = reader.drain(deadline, unpacking);
-    *wasAnswered = writer.wasStoppedByAnswer();
-    if (error != 0) return error;
+    if (const int error = reader.drain(deadline, unpacking); error != 0) return error;
   }
-  if (const int error = writer.finish(); error != 0) return error;
-  if (existing.isValid()) {
-    if (const int error = checkMerge(stage.get(), existing.get()); error != 0) return error;
-  } else if (::fchmod(stage.get(), kDirectoryMode) != 0) {
-    return errno;
-  }
-  // Before a name shows, what it stands for is on the disk; and the answer waits for the names.
-  if (const int error = syncFileSystem(stage.get()); error != 0) return error;
-  if (existing.isValid()) {
-    if (const int error = mergeStaged(stage.get(), existing.get()); error != 0) return error;
-    return syncFileSystem(existing.get());
-  }
-  if (const int error = stage.publish(IfPresent::fail); error != 0) return error;
-  return syncNames(place.directory.get());
+  return writer.finish();
 }
 
 int ZipArchiveCopier::copy(const std::string& archive, const std::string& destination,

@@ -10,6 +10,8 @@
 
 namespace brenvik {
 
+class UnpackWriter;
+
 // Unpacks zip archives. The archive is read by a short-lived process without rights, brenvik-archive-reader;
 // what it reports is written by this one, into a hidden directory first. A reader that dies, says nonsense or
 // takes too long is a failed copy.
@@ -36,6 +38,7 @@ class ZipArchiveCopier final : public ArchiveCopier {
  private:
   int unpack(const std::string& archive, const std::string& destination, const PropertyList& options,
              bool* wasAnswered);
+  int readInto(UnpackWriter& writer, int archive, std::chrono::steady_clock::time_point deadline);
 
   const std::string reader_;
   const std::chrono::milliseconds longest_;
