@@ -56,6 +56,18 @@ TEST(Base64Test, AnyBytesComeBackHoweverTheTextIsSpaced) {
   }
 }
 
+TEST(Base64Test, ASpaceIsNoDigitWhereverItStands) {
+  for (const char* text : {" AAAA", "A AAA", "AA AA", "AAA A", "AAAA "})
+    EXPECT_EQ(decoded(text), std::string(3, '\0')) << text;
+}
+
+TEST(Base64Test, WhatFollowsTheTextIsNotRead) {
+  const std::string_view digits = "Zm9vYmFy";
+  EXPECT_EQ(decoded(digits.substr(0, 4)), "foo");
+  for (const std::size_t size : {1UL, 2UL, 3UL, 5UL, 6UL, 7UL})
+    EXPECT_EQ(decoded(digits.substr(0, size)), std::nullopt) << size;
+}
+
 TEST(Base64Test, NothingElseIsBase64) {
   for (const char* text : {"Z", "Zg", "Zg=", "Zg===", "Zm8", "Zm8==", "Zm9v=", "=", "====", "Z===", "Zg=v",
                            "Zg==Zg==", "Zm9*", "Zm9-", "Zm9v.", "Zg==Z", "Z=g="}) {

@@ -41,6 +41,13 @@ TEST_F(BacklogGuessTest, TurnsThatFollowEachOtherAtOnceTellOfABacklog) {
   EXPECT_TRUE(guess.isLikely());
 }
 
+TEST_F(BacklogGuessTest, AtOnceIsLessThanAMicrosecond) {
+  turnsAfter(1000ns, 100);
+  EXPECT_FALSE(guess.isLikely());
+  turnsAfter(999ns, BacklogGuess::kTimedTurns + 1);
+  EXPECT_TRUE(guess.isLikely());
+}
+
 TEST_F(BacklogGuessTest, AClientThatWaitsForEachAnswerNeverCostsALook) {
   for (int i = 0; i < 1000; ++i) {
     turnAfter(BacklogGuess::kAtOnce);
