@@ -19,6 +19,9 @@ function(brenvik_tests target)
 endfunction()
 add_subdirectory(platform/a)
 """
+PRESETS = """{ "version": 6, "configurePresets": [
+  { "name": "dev", "generator": "Ninja", "binaryDir": "${sourceDir}/build/dev", "cacheVariables": { "CMAKE_BUILD_TYPE": "Debug" } } ] }
+"""
 CODE = """bool isSmall(int a) {
   return a < 10;
 }
@@ -64,6 +67,7 @@ class Mistakes(unittest.TestCase):
             self.write(name, (SOURCE / name).read_text(encoding="utf-8"))
             (self.tree / name).chmod(0o755)
         self.write("CMakeLists.txt", BUILD)
+        self.write("CMakePresets.json", PRESETS)
         self.write("platform/a/CMakeLists.txt", "brenvik_tests(platform_a)\n")
         self.write("platform/a/A.cpp", CODE)
         self.write("platform/a/ATest.cpp", TEST)
