@@ -2,6 +2,7 @@
 # SPDX-License-Identifier: Apache-2.0
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 """scripts/mutate finds the mistakes that can be made in a small source, and which of them its test does not notice."""
+import fcntl
 import json
 import os
 import pathlib
@@ -163,6 +164,12 @@ class Mistakes(unittest.TestCase):
         self.assertEqual(outcomes.count("survived"), 5, kept)
         self.assertEqual(outcomes.count("killed"), 3, kept)
         self.assertEqual(outcomes.count("timed out"), 3, kept)
+
+        # Two at a time would build in the same place.
+        with open(self.tree / "build/mutate/lock", "w", encoding="utf-8") as lock:
+            fcntl.flock(lock, fcntl.LOCK_EX)
+            busy = self.mutate("platform/a")
+        self.assertEqual((busy.returncode, busy.stderr), (2, "mutate: another run works in build/mutate\n"))
 
         # A second look builds nothing.
         again = self.mutate("platform/a")
