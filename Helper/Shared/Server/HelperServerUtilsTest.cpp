@@ -6,6 +6,7 @@
 
 #include <array>
 #include <cstring>
+#include <vector>
 
 #include "platform/base/fakes/FailingAllocations.h"
 #include "platform/ipc/fakes/FakePorts.h"
