@@ -223,6 +223,21 @@ TEST(PathPolicyTest, APathThatPassesOnlyAsAPackageStillLeavesTheThreeRefusalLine
   EXPECT_EQ(log.entries(), refusalLines("/tmp/update.tcpk", "/no/such/home/Library/Carrier Bundles/"));
 }
 
+TEST(PathPolicyTest, TheRootDirectoryIsAHomeToo) {
+  PathPolicy policy(accountAt("/"));
+  EXPECT_TRUE(policy.isListedCarrierPath("//Library/Carrier Bundle.bundle"));
+}
+
+// As long as a request's path field can be.
+TEST(PathPolicyTest, TheFirst1024BytesOfAPathAreCompared) {
+  const std::string home = '/' + std::string(1000, 'h');
+  PathPolicy policy(accountAt(home.c_str()));
+  const std::string entry = home + "/Library/Preferences/com.norvale.carrier.plist";
+  ASSERT_GT(entry.size(), 1024U);
+  EXPECT_TRUE(policy.isListedCarrierPath((entry.substr(0, 1024) + "other").c_str()));
+  EXPECT_FALSE(policy.isListedCarrierPath((entry.substr(0, 1023) + "Other").c_str()));
+}
+
 TEST(PathPolicyTest, WithoutAHomeTheHomeEntriesMatchNothingAndAnEmptyTextStandsInTheLine) {
   for (const char* home : {static_cast<const char*>(nullptr), ""}) {
     PathPolicy policy(accountAt(home));

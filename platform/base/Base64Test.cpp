@@ -3,7 +3,10 @@
 #include "platform/base/Base64.h"
 
 #include <gtest/gtest.h>
+#include <sys/mman.h>
+#include <unistd.h>
 
+#include <cstring>
 #include <optional>
 #include <random>
 #include <string>
@@ -54,6 +57,24 @@ TEST(Base64Test, AnyBytesComeBackHoweverTheTextIsSpaced) {
     }
     ASSERT_EQ(decoded(spaced), bytes) << spaced;
   }
+}
+
+TEST(Base64Test, ASpaceIsNoDigitWhereverItStands) {
+  for (const char* text : {" AAAA", "A AAA", "AA AA", "AAA A", "AAAA "})
+    EXPECT_EQ(decoded(text), std::string(3, '\0')) << text;
+}
+
+TEST(Base64Test, WhatFollowsTheTextIsNotRead) {
+  const auto page = static_cast<std::size_t>(::sysconf(_SC_PAGESIZE));
+  void* const pages = ::mmap(nullptr, 2 * page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+  ASSERT_NE(pages, MAP_FAILED);
+  char* const end = static_cast<char*>(pages) + page;
+  ASSERT_EQ(::mprotect(end, page, PROT_NONE), 0);
+  for (const std::string text : {"Z", "Zm", "Zm9", "Zm9v", "Zm9vY", "Zm9vYm", "Zm9vYmF"}) {
+    std::memcpy(end - text.size(), text.data(), text.size());
+    EXPECT_EQ(decoded({end - text.size(), text.size()}).has_value(), text == "Zm9v") << text;
+  }
+  ::munmap(pages, 2 * page);
 }
 
 TEST(Base64Test, NothingElseIsBase64) {

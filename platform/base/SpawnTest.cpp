@@ -4,6 +4,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -81,6 +82,13 @@ TEST(SpawnTest, WhatFailsIsSaidAndStartsNothing) {
   spawn.give(-1, STDOUT_FILENO);
   EXPECT_EQ(spawn.start("/bin/true", none, none, &pid), EBADF);
   EXPECT_EQ(pid, 77);
+}
+
+// 0 under a sanitizer, which looks for leaks itself.
+TEST(SpawnTest, WhatWasPreparedIsFreed) {
+  const std::size_t before = ::mallinfo2().uordblks;
+  for (int i = 0; i < 1000; ++i) Spawn().giveNothing(STDERR_FILENO);
+  EXPECT_LT(::mallinfo2().uordblks, before + 10'000);
 }
 
 }  // namespace

@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 #include <pthread.h>
 #include <sys/mman.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <array>
@@ -15,6 +16,13 @@
 #include <thread>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/base/fakes/FailingCalls.h"
+
+// 0 as the error: it writes nothing and names no error.
+extern "C" ssize_t pwrite(int file, const void* bytes, std::size_t size, off_t offset) {
+  if (brenvik::FailingCall::failsNow("pwrite")) return errno == 0 ? 0 : -1;
+  return ::syscall(SYS_pwrite64, file, bytes, size, offset);
+}
 
 namespace brenvik {
 namespace {
@@ -90,6 +98,15 @@ TEST(WriteAllTest, ReturnsTheErrorOfTheCallThatFailed) {
   ASSERT_EQ(::fcntl(pipe.to.get(), F_SETFL, O_NONBLOCK), 0);
   const std::string large(1'000'000, 'x');
   EXPECT_EQ(writeAll(pipe.to.get(), large), EAGAIN) << "after some of it was written";
+}
+
+TEST(WriteAllTest, ACallThatWritesNothingFailsAndAnInterruptedOneIsRepeated) {
+  const UniqueFd file(::memfd_create("test", MFD_CLOEXEC));
+  const FailingCall nothing("pwrite", 0);
+  EXPECT_EQ(writeAllAt(file.get(), 0, "x"), EIO);
+  const FailingCall interrupted("pwrite", EINTR);
+  EXPECT_EQ(writeAllAt(file.get(), 0, "y"), 0);
+  EXPECT_EQ(contentOf(file.get()), "y");
 }
 
 }  // namespace

@@ -68,9 +68,14 @@ TEST(SealedMemoryTest, BytesAreSealedInAndMappedByWhoeverGetsThem) {
   EXPECT_EQ(SealedMemory::map(memory.get(), bytes.size() + 1, &mapped), EBADMSG);
   EXPECT_TRUE(mapped.bytes().empty());
   ASSERT_EQ(SealedMemory::map(memory.get(), bytes.size(), &mapped), 0);
-  const SealedMemory moved = std::move(mapped);
+  SealedMemory moved = std::move(mapped);
   EXPECT_TRUE(std::equal(bytes.begin(), bytes.end(), moved.bytes().begin(), moved.bytes().end()));
+  EXPECT_TRUE(mapped.bytes().empty());
   EXPECT_EQ(SealedMemory::map(makeSealedMemory("test", {}).get(), 0, &mapped), 0) << "nothing to be mapped";
+  SealedMemory assigned;
+  assigned = std::move(moved);
+  EXPECT_TRUE(std::equal(bytes.begin(), bytes.end(), assigned.bytes().begin(), assigned.bytes().end()));
+  EXPECT_TRUE(moved.bytes().empty());
 }
 
 }  // namespace

@@ -6,6 +6,7 @@
 
 #include <array>
 #include <cstring>
+#include <vector>
 
 #include "platform/base/fakes/FailingAllocations.h"
 #include "platform/ipc/fakes/FakePorts.h"
@@ -189,6 +190,42 @@ TEST_F(ServerTest, LastClientGoesAwayWhileTheHostedServerIsBusyAndTheProcessStay
   clock.advance(10s);
   EXPECT_EQ(asked, 4);
   EXPECT_TRUE(server->isStopped());
+}
+
+TEST_F(ServerTest, TheFactsSayWhatKeepsTheServer) {
+  platform.now = [this] { return clock.now(); };
+  create();
+  SetIdleCheck(server.get(), [] { return true; });
+  const auto one = AcquireBusyToken(*server, "one");
+  const auto two = AcquireBusyToken(*server, "two");
+  const auto three = AcquireBusyToken(*server, "one");
+  auto facts = server->facts();
+  ASSERT_EQ(facts.busyTokens.size(), 2U);
+  EXPECT_STREQ(facts.busyTokens[0].first, "one");
+  EXPECT_EQ(facts.busyTokens[0].second, 2U);
+  EXPECT_STREQ(facts.busyTokens[1].first, "two");
+  EXPECT_EQ(facts.busyTokens[1].second, 1U);
+  EXPECT_FALSE(facts.leavesIn);
+  for (const auto token : {one, two, three}) (void)ReleaseBusyToken(*server, token);
+  clock.advance(3s);
+  facts = server->facts();
+  EXPECT_TRUE(facts.busyTokens.empty());
+  EXPECT_EQ(facts.leavesIn, 7s);
+  EXPECT_FALSE(facts.isKeptByIdleCheck);
+  clock.advance(8s);
+  facts = server->facts();
+  EXPECT_EQ(facts.leavesIn, 9s);
+  EXPECT_TRUE(facts.isKeptByIdleCheck);
+}
+
+TEST_F(ServerTest, WhoeverIsToldOfAChangeMayAskForTheFacts) {
+  std::vector<std::size_t> clients;
+  platform.onChange = [&] { clients.push_back(server->facts().clients); };
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  clientDies(0);
+  (void)ReleaseBusyToken(*server, AcquireBusyToken(*server));
+  EXPECT_EQ(clients, (std::vector<std::size_t>{1, 0, 0, 0}));
 }
 
 TEST_F(ServerTest, WithoutAHostedServerTheProcessStopsAtTheFirstTick10SecondsAfterTheLastClient) {

@@ -37,7 +37,16 @@ class BacklogGuessTest : public testing::Test {
 TEST_F(BacklogGuessTest, AtFirstNothingIsExpected) { EXPECT_FALSE(guess.isLikely()); }
 
 TEST_F(BacklogGuessTest, TurnsThatFollowEachOtherAtOnceTellOfABacklog) {
-  turnsAfter(300ns, BacklogGuess::kTimedTurns + 1);
+  turnsAfter(300ns, BacklogGuess::kTimedTurns);
+  EXPECT_FALSE(guess.isLikely()) << "the turn that is timed has just ended";
+  turnAfter(300ns);
+  EXPECT_TRUE(guess.isLikely());
+}
+
+TEST_F(BacklogGuessTest, AtOnceIsLessThanAMicrosecond) {
+  turnsAfter(1000ns, 100);
+  EXPECT_FALSE(guess.isLikely());
+  turnsAfter(999ns, BacklogGuess::kTimedTurns + 1);
   EXPECT_TRUE(guess.isLikely());
 }
 
