@@ -775,6 +775,28 @@ TEST_F(BusyClientTest, ItsRequestsCostAnotherClientNoMoreThanABudget) {
   EXPECT_EQ(table.served, 2 * kRequests + 1);
 }
 
+TEST_F(BusyClientTest, RequestsThatTakeLongCostAnotherClientOneOfThem) {
+  clockStep = 0ns;
+  ASSERT_LE(turnsForRequestsThatWait(), 32);
+  table.whileServing = [] { steppedTime += 10ms; };
+  for (int i = 0; i < 2 * 8 + 1; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
+  for (int turn = 0; turn < 2 * 8 + 1; ++turn) {
+    const int served = table.served;
+    loop->run(0s, ReturnAfterSource::yes);
+    EXPECT_EQ(table.served, served + 1) << turn;
+  }
+}
+
+TEST_F(BusyClientTest, OneWayRequestsThatTakeLongCostAnotherClientTwoOfThem) {
+  clockStep = 0ns;
+  table.whileServing = [] { steppedTime += 10ms; };
+  for (int i = 0; i < 16; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho, 0, 24, 0)));
+  loop->run(0s, ReturnAfterSource::yes);
+  EXPECT_EQ(table.served, 2);
+  pump();
+  EXPECT_EQ(table.served, 16);
+}
+
 TEST_F(PortsTest, AClientThatShutsItsChannelIsReadNoMoreAndWakesNobody) {
   ASSERT_EQ(::shutdown(client.get(), SHUT_RDWR), 0);
   pump();
