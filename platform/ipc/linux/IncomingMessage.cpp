@@ -103,7 +103,8 @@ KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
     std::byte* const at = storage_.bytes.data() + descriptor->offset;
     if (descriptor->kind == WalkedDescriptor::Kind::port) {
       UniqueFd& fd = fds_[nextFd++];
-      if (!isLocalSocket(fd.get())) return mig::badArguments;
+      // One that listens is nobody's other end: nothing would ever tell that a client with it is gone.
+      if (!isLocalSocket(fd.get(), Listening::no)) return mig::badArguments;
       const PortName name = ports_.adoptSendRight(std::move(fd), account_);
       if (name == kNullPort) return kern::resourceShortage;
       names_[nameCount_++] = name;

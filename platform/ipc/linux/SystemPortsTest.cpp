@@ -540,13 +540,20 @@ TEST_F(PortsTest, TheWalkEndsAtAnUnknownTypeAndAtADescriptorThatIsCutOff) {
 
 // ---- rights of requests ----
 
-TEST_F(PortsTest, ARightMustBeASeqpacketSocketOfTheUnixFamily) {
+TEST_F(PortsTest, ARightMustBeASeqpacketSocketOfTheUnixFamilyThatDoesNotListen) {
   const std::size_t before = openDescriptors();
   const auto refused = [&](const UniqueFd& fd) {
     Datagram datagram = complexMessage(kKeepRight, 1, 40).add(right());
     datagram.fds = {fd.get()};
     EXPECT_EQ(codeOf(datagram), -304);
   };
+  UniqueFd listening(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+  const sockaddr_un anyName{AF_UNIX, {}};
+  ASSERT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&anyName), sizeof anyName.sun_family),
+            0);
+  ASSERT_EQ(::listen(listening.get(), 1), 0);
+  refused(listening);
+  listening.reset();
   refused(std::move(pair(SOCK_STREAM).first));
   refused(std::move(pair(SOCK_DGRAM).first));
   refused(UniqueFd(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)));
