@@ -9,6 +9,7 @@
 #include <cstdint>
 
 #include "client/Region.h"
+#include "client/TurnedAway.h"
 
 namespace brenvik::client {
 
@@ -69,6 +70,8 @@ class Listener {
   std::int32_t systemFailure() noexcept;
   std::int32_t prepare() noexcept;
   std::int32_t watch(Service service) noexcept;
+  // Whether new connections are looked at.
+  void setAccepting(bool isAccepting) noexcept;
   void watchNames() noexcept;
   // Whether a service has lost its file since it was last asked.
   bool hasLostName() noexcept;
@@ -84,6 +87,8 @@ class Listener {
   std::array<ServiceSocket, 2> services_;
   std::array<bool, 2> hasLostName_{};
   std::array<Connection, kMaxConnections> connections_;
+  TurnedAway turnedAway_;
+  bool isAccepting_ = true;
   std::uint64_t lastSerial_ = 0;
   uid_t allowedUid_ = 0;  // beside the superuser and our own
   int systemError_ = 0;
