@@ -271,22 +271,25 @@ std::int32_t Listener::next(Deadline deadline, bvmh_event* event) noexcept {
       continue;
     }
     std::int32_t code = BVMH_OK;
-    if (ready.data.u64 == kNamesKey) {
-      if (hasLostName()) return BVMH_ERROR_NAME_LOST;
-      continue;
-    }
-    if (ready.data.u64 == kTurnedAwayKey) {
-      turnedAway_.wasTold();
-      setAccepting(true);
-      continue;
-    }
-    if (ready.data.u64 < kFirstConnectionKey) {
-      code = accept(static_cast<Service>(ready.data.u64));
-      if (code != BVMH_OK) return code;
-      continue;
-    }
-    if (read(connections_[ready.data.u64 - kFirstConnectionKey], event, &code)) return code;
+    if (serve(ready.data.u64, event, &code)) return code;
   }
+}
+
+bool Listener::serve(std::uint64_t key, bvmh_event* event, std::int32_t* code) noexcept {
+  if (key == kNamesKey) {
+    *code = BVMH_ERROR_NAME_LOST;
+    return hasLostName();
+  }
+  if (key == kTurnedAwayKey) {
+    turnedAway_.wasTold();
+    setAccepting(true);
+    return false;
+  }
+  if (key < kFirstConnectionKey) {
+    *code = accept(static_cast<Service>(key));
+    return *code != BVMH_OK;
+  }
+  return read(connections_[key - kFirstConnectionKey], event, code);
 }
 
 bool Listener::read(Connection& connection, bvmh_event* event, std::int32_t* code) noexcept {

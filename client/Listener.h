@@ -76,6 +76,8 @@ class Listener {
   // Whether a service has lost its file since it was last asked.
   bool hasLostName() noexcept;
   std::int32_t accept(Service service) noexcept;
+  // Deals with what is ready, by its key in poll_; true when `*code` is for the caller.
+  bool serve(std::uint64_t key, bvmh_event* event, std::int32_t* code) noexcept;
   // Reads one message; true when it was one for the caller.
   bool read(Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;
   bool readPush(const Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;

@@ -195,25 +195,9 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
     TurnClock clock;
     if (backlog_.isLikely()) clock.start();
     for (int taken = 0; taken < kMessageBudget && pending_ == nullptr && owner_ != nullptr; ++taken) {
-      if (isDoor_ && !owner_->mayBeRead(*this)) {
-        // Who has gone does not wait for an answer, nor keep the place of one who does.
-        if (readiness.isOver()) return end();
-        isLimited_ = true;
-        return pause();
-      }
-      const auto received = isDoor_ ? incoming_.peek(fd_->get(), account()) : incoming_.receive(fd_->get());
-      if (received == IncomingMessage::Received::endOfChannel) return end();
-      if (received == IncomingMessage::Received::nothing) {
-        backlog_.foundNothing();
-        break;
-      }
-      const bool answerWanted = incoming_.hasHeader() && incoming_.header().replyPort != kNullPort;
-      serve();
-      if (source_ == nullptr) return;  // paused, or ended
-      // A client that waits for its answer sends nothing meanwhile.
-      if (answerWanted && (isDoor_ || !backlog_.isLikely())) break;
-      if (clock.isOver()) break;
+      if (!takeOne(readiness) || clock.isOver()) break;
     }
+    if (source_ == nullptr) return;  // paused, or ended
     backlog_.turnEnds(std::chrono::steady_clock::now);
     if (owner_ != nullptr && pending_ == nullptr && readiness.isOver() && !readiness.isReadable) {
       end();  // nothing left to read, and nobody left to answer
@@ -225,6 +209,24 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
     ChannelOwner* const owner = owner_;
     close();
     if (owner != nullptr) owner->ended(*this);
+  }
+
+  // Takes a message and serves it. True when one more may be taken in this turn.
+  bool takeOne(Readiness readiness) noexcept {
+    if (isDoor_ && !owner_->mayBeRead(*this)) {
+      // Who has gone does not wait for an answer, nor keep the place of one who does.
+      isLimited_ = !readiness.isOver();
+      isLimited_ ? pause() : end();
+      return false;
+    }
+    const auto received = isDoor_ ? incoming_.peek(fd_->get(), account()) : incoming_.receive(fd_->get());
+    if (received == IncomingMessage::Received::endOfChannel) end();
+    if (received == IncomingMessage::Received::nothing) backlog_.foundNothing();
+    if (received != IncomingMessage::Received::message) return false;
+    const bool answerWanted = incoming_.hasHeader() && incoming_.header().replyPort != kNullPort;
+    serve();
+    // A client that waits for its answer sends nothing meanwhile.
+    return source_ != nullptr && (!answerWanted || (!isDoor_ && backlog_.isLikely()));
   }
 
   // Sends the reply that waited. True when the channel may be read again.
