@@ -31,9 +31,9 @@ namespace {
 // Messages taken from one channel in a row before the others get their turn.
 constexpr int kMessageBudget = 8;
 
-// How long those messages may keep the others waiting: a thousand times as long as a usual one takes. Some
+// How long those messages may keep the others waiting: a thousand usual ones take that long. Some
 // take long by themselves, like a large property list, and eight of those would add up.
-constexpr std::chrono::milliseconds kLongestTurn{5};
+constexpr std::chrono::milliseconds kLongestTurn{20};
 
 // Connections accepted in a row; the next wake-up goes on.
 constexpr int kAcceptBudget = 16;

@@ -785,7 +785,7 @@ TEST_F(BusyClientTest, ItsRequestsCostAnotherClientNoMoreThanABudget) {
 TEST_F(BusyClientTest, RequestsThatTakeLongCostAnotherClientOneOfThem) {
   clockStep = 0ns;
   ASSERT_LE(turnsForRequestsThatWait(), 32);
-  table.whileServing = [] { steppedTime += 10ms; };
+  table.whileServing = [] { steppedTime += 30ms; };
   for (int i = 0; i < 2 * 8 + 1; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
   for (int turn = 0; turn < 2 * 8 + 1; ++turn) {
     const int served = table.served;
@@ -796,7 +796,7 @@ TEST_F(BusyClientTest, RequestsThatTakeLongCostAnotherClientOneOfThem) {
 
 TEST_F(BusyClientTest, OneWayRequestsThatTakeLongCostAnotherClientTwoOfThem) {
   clockStep = 0ns;
-  table.whileServing = [] { steppedTime += 10ms; };
+  table.whileServing = [] { steppedTime += 30ms; };
   for (int i = 0; i < 16; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho, 0, 24, 0)));
   loop->run(0s, ReturnAfterSource::yes);
   EXPECT_EQ(table.served, 2);
