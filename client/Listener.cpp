@@ -31,6 +31,7 @@ constexpr int kMaxOvertime = 64;
 // Events of the services carry 0 and 1, those of a connection its index and this.
 constexpr std::uint64_t kFirstConnectionKey = 2;
 constexpr std::uint64_t kNamesKey = UINT64_MAX;
+constexpr std::uint64_t kTurnedAwayKey = UINT64_MAX - 1;
 
 template <class Message>
 Message readAs(std::span<const std::byte> datagram) noexcept {
@@ -128,7 +129,12 @@ std::int32_t Listener::prepare() noexcept {
   systemError_ = 0;
   if (!buffer_.ensure()) return BVMH_ERROR_NO_MEMORY;
   poll_.reset(::epoll_create1(EPOLL_CLOEXEC));
-  return poll_.isValid() ? BVMH_OK : systemFailure();
+  if (!poll_.isValid() || !turnedAway_.prepare()) return systemFailure();
+  epoll_event event{};
+  event.events = EPOLLIN;
+  event.data.u64 = kTurnedAwayKey;
+  return ::epoll_ctl(poll_.get(), EPOLL_CTL_ADD, turnedAway_.readable(), &event) == 0 ? BVMH_OK
+                                                                                      : systemFailure();
 }
 
 std::int32_t Listener::watch(Service service) noexcept {
@@ -137,6 +143,18 @@ std::int32_t Listener::watch(Service service) noexcept {
   event.data.u64 = static_cast<std::uint64_t>(service);
   const int socket = services_[static_cast<std::size_t>(service)].get();
   return ::epoll_ctl(poll_.get(), EPOLL_CTL_ADD, socket, &event) == 0 ? BVMH_OK : systemFailure();
+}
+
+void Listener::setAccepting(bool isAccepting) noexcept {
+  if (isAccepting_ == isAccepting) return;
+  isAccepting_ = isAccepting;
+  for (const Service service : {Service::pushes, Service::notifications}) {
+    epoll_event event{};
+    event.events = isAccepting ? std::uint32_t{EPOLLIN} : 0U;
+    event.data.u64 = static_cast<std::uint64_t>(service);
+    const int socket = services_[static_cast<std::size_t>(service)].get();
+    if (socket >= 0) (void)::epoll_ctl(poll_.get(), EPOLL_CTL_MOD, socket, &event);
+  }
 }
 
 std::int32_t Listener::open(int pushes, int notifications) noexcept {
@@ -207,6 +225,11 @@ bool Listener::hasLostName() noexcept {
 }
 
 std::int32_t Listener::accept(Service service) noexcept {
+  // Too much of strangers' waits to be closed: the next one's could be neither kept nor closed.
+  if (!turnedAway_.hasRoom()) {
+    setAccepting(false);
+    return BVMH_OK;
+  }
   UniqueFd socket(::accept4(services_[static_cast<std::size_t>(service)].get(), nullptr, nullptr,
                             SOCK_CLOEXEC | SOCK_NONBLOCK));
   if (!socket.isValid()) {
@@ -214,7 +237,10 @@ std::int32_t Listener::accept(Service service) noexcept {
     return isOver ? BVMH_OK : systemFailure();
   }
   const auto peer = peerOf(socket.get());
-  if (!peer || (peer->uid != 0 && peer->uid != ::geteuid() && peer->uid != allowedUid_)) return BVMH_OK;
+  if (!peer || (peer->uid != 0 && peer->uid != ::geteuid() && peer->uid != allowedUid_)) {
+    turnedAway_.close(std::move(socket));
+    return BVMH_OK;
+  }
   // All places taken: the oldest connection has had its time.
   const auto place = std::min_element(
       connections_.begin(), connections_.end(), [](const Connection& a, const Connection& b) {
@@ -245,17 +271,25 @@ std::int32_t Listener::next(Deadline deadline, bvmh_event* event) noexcept {
       continue;
     }
     std::int32_t code = BVMH_OK;
-    if (ready.data.u64 == kNamesKey) {
-      if (hasLostName()) return BVMH_ERROR_NAME_LOST;
-      continue;
-    }
-    if (ready.data.u64 < kFirstConnectionKey) {
-      code = accept(static_cast<Service>(ready.data.u64));
-      if (code != BVMH_OK) return code;
-      continue;
-    }
-    if (read(connections_[ready.data.u64 - kFirstConnectionKey], event, &code)) return code;
+    if (serve(ready.data.u64, event, &code)) return code;
   }
+}
+
+bool Listener::serve(std::uint64_t key, bvmh_event* event, std::int32_t* code) noexcept {
+  if (key == kNamesKey) {
+    *code = BVMH_ERROR_NAME_LOST;
+    return hasLostName();
+  }
+  if (key == kTurnedAwayKey) {
+    turnedAway_.wasTold();
+    setAccepting(true);
+    return false;
+  }
+  if (key < kFirstConnectionKey) {
+    *code = accept(static_cast<Service>(key));
+    return *code != BVMH_OK;
+  }
+  return read(connections_[key - kFirstConnectionKey], event, code);
 }
 
 bool Listener::read(Connection& connection, bvmh_event* event, std::int32_t* code) noexcept {

@@ -9,6 +9,7 @@
 #include <cstdint>
 
 #include "client/Region.h"
+#include "client/TurnedAway.h"
 
 namespace brenvik::client {
 
@@ -69,10 +70,14 @@ class Listener {
   std::int32_t systemFailure() noexcept;
   std::int32_t prepare() noexcept;
   std::int32_t watch(Service service) noexcept;
+  // Whether new connections are looked at.
+  void setAccepting(bool isAccepting) noexcept;
   void watchNames() noexcept;
   // Whether a service has lost its file since it was last asked.
   bool hasLostName() noexcept;
   std::int32_t accept(Service service) noexcept;
+  // Deals with what is ready, by its key in poll_; true when `*code` is for the caller.
+  bool serve(std::uint64_t key, bvmh_event* event, std::int32_t* code) noexcept;
   // Reads one message; true when it was one for the caller.
   bool read(Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;
   bool readPush(const Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;
@@ -84,6 +89,8 @@ class Listener {
   std::array<ServiceSocket, 2> services_;
   std::array<bool, 2> hasLostName_{};
   std::array<Connection, kMaxConnections> connections_;
+  TurnedAway turnedAway_;
+  bool isAccepting_ = true;
   std::uint64_t lastSerial_ = 0;
   uid_t allowedUid_ = 0;  // beside the superuser and our own
   int systemError_ = 0;

@@ -1,7 +1,9 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include <arpa/inet.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <netinet/in.h>
 #include <poll.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
@@ -19,6 +21,7 @@
 #include <thread>
 #include <vector>
 
+#include "client/TurnedAway.h"
 #include "client/fakes/ScriptedHelper.h"
 #include "client/include/brenvik/mobile_helper.h"
 
@@ -554,6 +557,66 @@ TEST_F(ListenerTest, OtherUsersAreTurnedAwayUnlessAllowed) {
   EXPECT_EQ(next(BVMH_EVENT_NOTIFICATION), "stranger");
   EXPECT_EQ(event_.sender_uid, kStranger);
   bvmh_event_free(&event_);
+}
+
+// A TCP socket whose last close waits an hour, because nobody reads what it has sent.
+UniqueFd lingeringSocket(UniqueFd* listening) {
+  *listening = UniqueFd(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  const int small = 1;
+  ::setsockopt(listening->get(), SOL_SOCKET, SO_RCVBUF, &small, sizeof small);
+  sockaddr_in address{};
+  address.sin_family = AF_INET;
+  address.sin_addr.s_addr = ::htonl(INADDR_LOOPBACK);
+  socklen_t size = sizeof address;
+  auto* const generic = reinterpret_cast<sockaddr*>(&address);
+  EXPECT_EQ(::bind(listening->get(), generic, size), 0);
+  EXPECT_EQ(::listen(listening->get(), 1), 0);
+  EXPECT_EQ(::getsockname(listening->get(), generic, &size), 0);
+  UniqueFd made(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  ::setsockopt(made.get(), SOL_SOCKET, SO_SNDBUF, &small, sizeof small);
+  EXPECT_EQ(::connect(made.get(), generic, size), 0);
+  const linger hour{1, 3600};
+  ::setsockopt(made.get(), SOL_SOCKET, SO_LINGER, &hour, sizeof hour);
+  const std::array<char, 65536> bytes{};
+  while (::send(made.get(), bytes.data(), bytes.size(), MSG_DONTWAIT | MSG_NOSIGNAL) > 0) {
+  }
+  return made;
+}
+
+TEST_F(ListenerTest, WhatAStrangerSendsAlongHoldsUpNobody) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs the superuser to become somebody else";
+  ASSERT_EQ(::chmod(directory_.path().c_str(), 0755), 0);
+  // Whoever waits for a close is here, and the test ends it by reading.
+  std::array<UniqueFd, TurnedAway::kMaxThreads> readers;
+  listen();
+  const auto open = openDescriptors();
+  const auto connectAsStranger = [&](UniqueFd& reader) {
+    UniqueFd listening;
+    UniqueFd lingering = lingeringSocket(&listening);
+    reader.reset(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC));
+    const pid_t child = ::fork();
+    if (child == 0) {
+      if (::setresuid(54321, 54321, 54321) != 0) ::_exit(2);
+      const UniqueFd socket = connectTo(directory_.path() + kNotifications);
+      Script wire;
+      wire.send(socket, Bytes(24), {lingering.get()});
+      ::_exit(0);
+    }
+    int status = 0;
+    EXPECT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
+  };
+  for (UniqueFd& reader : readers) connectAsStranger(reader);
+  EXPECT_EQ(bvmh_listener_next(listener_.get(), 0, &event_), BVMH_ERROR_TIMED_OUT) << "and not in an hour";
+  // All threads are busy, so nobody is let in until one has done.
+  Script wire;
+  const UniqueFd friendly = connect(kNotifications);
+  wire.send(friendly, Bytes(24).append("waits"));
+  EXPECT_EQ(bvmh_listener_next(listener_.get(), 0, &event_), BVMH_ERROR_TIMED_OUT);
+  readers.front().reset();  // a reset: nothing is left to wait for
+  EXPECT_EQ(next(BVMH_EVENT_NOTIFICATION), "waits");
+  readers = {};
+  while (openDescriptors() > open + 2) std::this_thread::yield();
 }
 
 }  // namespace

@@ -162,6 +162,19 @@ class HostileClients(HelperTest):
         for pid in pids:
             self.assertEqual(os.waitstatus_to_exitcode(os.waitpid(pid, 0)[1]), 0)
 
+    def test_a_client_whose_end_nobody_could_notice_is_not_let_in(self):
+        self.assert_served()
+        before = self.settled_descriptors()
+        with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as listening:
+            listening.bind("\0never-hangs-up")
+            listening.listen()
+            service = wire.connect()
+            self.assertEqual(service.status(wire.check_in_message(), [listening.fileno()]), -304)
+            service.close()
+        eventually(lambda: self.daemon.descriptors() <= before, what="the descriptors going back")
+        self.good.close()
+        self.assertEqual(self.daemon.wait(), 0, "nobody holds the process")
+
     def settled_descriptors(self):
         """How many it has when it has done all that was asked of it."""
         seen = []

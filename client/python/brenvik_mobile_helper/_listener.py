@@ -6,6 +6,7 @@ import select
 import socket
 import stat
 import struct
+import threading
 from time import monotonic
 
 from . import _wire
@@ -215,6 +216,53 @@ def _is_service(sock: socket.socket) -> bool:
             and sock.getsockopt(socket.SOL_SOCKET, socket.SO_ACCEPTCONN) == 1)
 
 
+class _TurnedAway:
+    """Closes connections of strangers. What a stranger has put into one is closed with it, and a socket that lingers is
+    closed when its maker likes. So a connection that is not empty is closed by a thread of its own; there are few, and
+    nobody is to be accepted while all of them are busy."""
+
+    MOST_THREADS = 16
+
+    def __init__(self):
+        self.event = os.eventfd(0, os.EFD_CLOEXEC | os.EFD_NONBLOCK)  # readable when there may be room again
+        self._lock = threading.Lock()  # keeps a thread from writing to an event that was closed
+        self._busy = 0
+
+    def has_room(self) -> bool:
+        return self._busy < self.MOST_THREADS
+
+    def close(self, sock: socket.socket) -> None:
+        # Nothing is put into it once it is shut. With credentials asked for, whatever is there shows as cut.
+        try:
+            sock.shutdown(socket.SHUT_RDWR)
+            sock.setsockopt(socket.SOL_SOCKET, socket.SO_PASSCRED, 1)
+            data, _, flags, _ = sock.recvmsg(1, 0, socket.MSG_PEEK | socket.MSG_DONTWAIT)
+            if not data and not flags:
+                sock.close()
+                return
+        except OSError:
+            pass  # as one that is not empty
+        with self._lock:
+            self._busy += 1
+        # It does not keep the interpreter from leaving.
+        try:
+            threading.Thread(target=self._close, args=(sock.detach(),), daemon=True).start()
+        except RuntimeError:
+            pass  # no thread: it stays open, and counts as one that is still being closed
+
+    def _close(self, descriptor: int) -> None:
+        os.close(descriptor)
+        with self._lock:
+            self._busy -= 1
+            if self.event >= 0:
+                os.eventfd_write(self.event, 1)
+
+    def end(self) -> None:
+        with self._lock:
+            os.close(self.event)
+            self.event = -1
+
+
 class Listener:
     """Receives the helper's pushes and notifications, in the order they come.
 
@@ -263,6 +311,7 @@ class Listener:
             self._open({name: _Service(sock) for name, sock in given.items()})
         except BaseException:
             self._poll.close()
+            self._turned_away.end()
             raise
         for sock in given.values():
             sock.setblocking(False)
@@ -300,6 +349,8 @@ class Listener:
         self._answer = bool(answer)
         self._allowed = {0, os.geteuid()} | ({allowed_uid} if allowed_uid is not None else set())
         self._poll = select.epoll()
+        self._turned_away = _TurnedAway()
+        self._poll.register(self._turned_away.event, select.EPOLLIN)
         self._names = -1
         self._services: dict[int, tuple[str, _Service]] = {}
         self._connections: dict[int, tuple[socket.socket, str, int, int]] = {}  # the oldest first
@@ -342,7 +393,9 @@ class Listener:
         for _, each in self._services.values():
             each.close()
         self._services.clear()
-        self._poll.close()
+        if not self._poll.closed:
+            self._poll.close()
+            self._turned_away.end()
         if self._names >= 0:
             os.close(self._names)
             self._names = -1
@@ -386,20 +439,31 @@ class Listener:
         if descriptor == self._names:
             self._look_for_names()
             return None
+        if descriptor == self._turned_away.event:
+            os.eventfd_read(descriptor)
+            self._look_for_connections(select.EPOLLIN)
+            return None
         service = self._services.get(descriptor)
         if service is not None:
             self._accept(*service)
             return None
         return self._read(descriptor)
 
+    def _look_for_connections(self, events: int) -> None:
+        for _, each in self._services.values():
+            self._poll.modify(each.sock, events)
+
     def _accept(self, name: str, service: _Service) -> None:
+        if not self._turned_away.has_room():
+            self._look_for_connections(0)
+            return
         try:
             sock, _ = service.sock.accept()
         except (BlockingIOError, ConnectionAbortedError):
             return
         pid, uid, _ = struct.unpack("iII", sock.getsockopt(socket.SOL_SOCKET, socket.SO_PEERCRED, 12))
         if uid not in self._allowed:
-            sock.close()
+            self._turned_away.close(sock)
             return
         if len(self._connections) >= _MOST_CONNECTIONS:  # the oldest has had its time
             self._end(next(iter(self._connections)))

@@ -39,6 +39,24 @@ def code_of(reply):
     return struct.unpack_from("<i", reply, 32)[0]
 
 
+def lingering_socket():
+    """A TCP socket whose last close waits an hour, and its other end, which does not read."""
+    with socket.socket() as listening, socket.socket() as sock:
+        listening.setsockopt(socket.SOL_SOCKET, socket.SO_RCVBUF, 1)
+        listening.bind(("127.0.0.1", 0))
+        listening.listen(1)
+        sock.setsockopt(socket.SOL_SOCKET, socket.SO_SNDBUF, 1)
+        sock.connect(listening.getsockname())
+        reader = listening.accept()[0]
+        sock.setsockopt(socket.SOL_SOCKET, socket.SO_LINGER, struct.pack("ii", 1, 3600))
+        sock.setblocking(False)
+        try:
+            while True:
+                sock.send(bytes(65536))
+        except BlockingIOError:
+            return sock.dup(), reader
+
+
 class Pushes(support.InFolder):
     def listener(self, **options):
         listener = Listener(self.folder, **options)
@@ -171,6 +189,32 @@ class Pushes(support.InFolder):
                 status = os.waitpid(child, 0)[1]
             self.assertEqual((event is not None, os.waitstatus_to_exitcode(status)), (taken, 0 if taken else 1))
             listener.close()
+
+    @unittest.skipUnless(os.geteuid() == 0, "needs root to become somebody else")
+    def test_what_a_stranger_sends_along_holds_up_nobody(self):
+        self.folder.chmod(0o755)
+        listener = self.listener()
+        readers = []
+        for _ in range(16):  # as many as it has threads for
+            sock, reader = lingering_socket()
+            self.addCleanup(reader.close)
+            readers.append(reader)
+            child = os.fork()
+            if child == 0:
+                os.setresuid(65534, 65534, 65534)
+                with support.connected(self.folder / PUSHES) as stranger:
+                    socket.send_fds(stranger, [b"x"], [sock.fileno()])
+                os._exit(0)
+            sock.close()
+            self.assertEqual(os.waitstatus_to_exitcode(os.waitpid(child, 0)[1]), 0)
+        self.assertIsNone(listener.next(0), "and not in an hour")
+        self.send(support.push_message(CIVIC, plist(City="waits")))
+        self.assertIsNone(listener.next(0))
+        readers[0].close()  # nothing is left to wait for
+        self.assertEqual(listener.next(60).city, "waits")
+        for reader in readers:
+            reader.close()
+        self.assertIsNone(listener.next(0))
 
     def test_many_connections_push_out_the_oldest_and_nothing_is_lost(self):
         listener = self.listener()

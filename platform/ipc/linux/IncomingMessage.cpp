@@ -13,6 +13,13 @@
 #include "platform/datagram/SealedMemory.h"
 
 namespace brenvik {
+namespace {
+
+// Bytes of memory that are given back in less time than a request takes that needs the disk. The last close
+// of larger memory would hold everybody up, for a second with some gigabytes.
+constexpr std::int64_t kQuicklyFreed = std::int64_t{4} << 20;
+
+}  // namespace
 
 IncomingMessage::~IncomingMessage() { release(false); }
 
@@ -55,12 +62,15 @@ IncomingMessage::Received IncomingMessage::receive(int fd, int flags, std::size_
   return Received::message;
 }
 
-KernelReturn IncomingMessage::mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept {
-  if (sizeOfSealedMemory(fd) < static_cast<std::int64_t>(length)) return mig::badArguments;
-  void* const mapped = mapSealedMemory(fd, length);
+KernelReturn IncomingMessage::mapRegion(UniqueFd& fd, std::uint32_t length, std::uint64_t* address) noexcept {
+  const std::int64_t size = sizeOfSealedMemory(fd.get());
+  if (size < static_cast<std::int64_t>(length)) return mig::badArguments;
+  void* const mapped = mapSealedMemory(fd.get(), length);
   if (mapped == nullptr) return kern::resourceShortage;
   mappings_[mappingCount_++] = {mapped, length};
   *address = reinterpret_cast<std::uint64_t>(mapped);
+  // Large memory stays open, for release() to have it closed elsewhere.
+  if (size <= kQuicklyFreed) fd.reset();
   return kern::success;
 }
 
@@ -93,7 +103,8 @@ KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
     std::byte* const at = storage_.bytes.data() + descriptor->offset;
     if (descriptor->kind == WalkedDescriptor::Kind::port) {
       UniqueFd& fd = fds_[nextFd++];
-      if (!isLocalSocket(fd.get())) return mig::badArguments;
+      // One that listens is nobody's other end: nothing would ever tell that a client with it is gone.
+      if (!isLocalSocket(fd.get(), Listening::no)) return mig::badArguments;
       const PortName name = ports_.adoptSendRight(std::move(fd), account_);
       if (name == kNullPort) return kern::resourceShortage;
       names_[nameCount_++] = name;
@@ -105,10 +116,8 @@ KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
       address = reinterpret_cast<std::uint64_t>(storage_.bytes.data() + descriptor->regionOffset);
     } else if (descriptor->kind == WalkedDescriptor::Kind::memfdRegion) {
       if (peeked_) return mig::badArguments;  // nothing of a stranger's is mapped
-      UniqueFd& fd = fds_[nextFd++];
-      const KernelReturn code = mapRegion(fd.get(), descriptor->regionLength, &address);
+      const KernelReturn code = mapRegion(fds_[nextFd++], descriptor->regionLength, &address);
       if (code != kern::success) return code;
-      fd.reset();  // memory: its close waits for nobody
     }
     std::memcpy(at + offsetof(OutOfLineDescriptor, address), &address, sizeof address);
   }
@@ -118,8 +127,9 @@ KernelReturn IncomingMessage::unpack(PortName localPort) noexcept {
 }
 
 void IncomingMessage::release(bool keepRights) noexcept {
-  for (std::size_t i = 0; i < fdCount_; ++i) ports_.closing().close(std::move(fds_[i]), account_);
+  // Mappings first: the last of the two to go frees the memory.
   for (std::size_t i = 0; i < mappingCount_; ++i) ::munmap(mappings_[i].address, mappings_[i].length);
+  for (std::size_t i = 0; i < fdCount_; ++i) ports_.closing().close(std::move(fds_[i]), account_);
   if (!keepRights) {
     for (std::size_t i = 0; i < nameCount_; ++i) (void)ports_.deallocateSendRight(names_[i]);
   }

@@ -73,7 +73,7 @@ class IncomingMessage {
   bool isPlain() const noexcept {
     return (header().bits & kComplexBit) == 0 && fdCount_ == 0 && !descriptorsCut_;
   }
-  KernelReturn mapRegion(int fd, std::uint32_t length, std::uint64_t* address) noexcept;
+  KernelReturn mapRegion(UniqueFd& fd, std::uint32_t length, std::uint64_t* address) noexcept;
 
   Received receive(int fd, int flags, std::size_t controlRoom, ClosingLine::Account account) noexcept;
 

@@ -8,10 +8,43 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <fstream>
+#include <string>
+#include <string_view>
+
 #include "platform/base/fakes/FailingAllocations.h"
 #include "platform/base/fakes/FailingCalls.h"
 #include "platform/datagram/LocalSocket.h"
 #include "platform/datagram/SealedMemory.h"
+
+namespace brenvik {
+namespace {
+
+// A descriptor whose close is watched: which thread closed it, and whether it was still mapped then.
+std::atomic<int> watchedDescriptor{-1};
+std::atomic<pid_t> closedBy{0};
+std::atomic<bool> wasMappedAtClose{false};
+
+bool isMapped(std::string_view name) {
+  std::ifstream maps("/proc/self/maps");
+  for (std::string line; std::getline(maps, line);) {
+    if (line.find(name) != std::string::npos) return true;
+  }
+  return false;
+}
+
+}  // namespace
+}  // namespace brenvik
+
+extern "C" int close(int fd) {
+  int watched = fd;
+  if (fd >= 0 && brenvik::watchedDescriptor.compare_exchange_strong(watched, -1)) {
+    brenvik::wasMappedAtClose = brenvik::isMapped("/memfd:watched");
+    brenvik::closedBy = ::gettid();
+  }
+  return static_cast<int>(::syscall(SYS_close, fd));
+}
 
 extern "C" void* mmap(void* at, std::size_t length, int protection, int flags, int fd,
                       off_t offset) noexcept {
@@ -77,6 +110,43 @@ TEST_F(IncomingMessageTest, ARegionThatCannotBeMappedRefusesTheMessage) {
   send(region, memfd.get());
   ASSERT_EQ(incoming.receive(ours.get()), Received::message);
   EXPECT_EQ(incoming.unpack(5), kern::success) << "the next one is served";
+}
+
+class MemoryOfTest : public IncomingMessageTest {
+ protected:
+  // Sends a region of ten bytes in memory of that size, of which the receiver is the last holder, has it
+  // served and watches who closes it.
+  void serveMemoryOf(off_t size) {
+    UniqueFd memory = makeSealableMemory("watched");
+    ASSERT_EQ(::ftruncate(memory.get(), size), 0);
+    ASSERT_TRUE(sealMemory(memory.get()));
+    send(OutOfLineDescriptor{0, 0, 1, 0, kOutOfLineDescriptorType, 10}, memory.get());
+    watchedDescriptor = memory.get();
+    memory.reset();
+    ASSERT_EQ(closedBy, ::gettid());
+    closedBy = 0;
+    const int next = ::dup(ours.get());  // the number that it will arrive with
+    watchedDescriptor = next;
+    ASSERT_EQ(::syscall(SYS_close, next), 0);
+    ASSERT_EQ(incoming.receive(ours.get()), Received::message);
+    ASSERT_EQ(incoming.unpack(5), kern::success);
+    EXPECT_TRUE(isMapped("/memfd:watched"));
+    incoming.release(true);
+    ports.closing().drain();
+    EXPECT_FALSE(isMapped("/memfd:watched"));
+  }
+};
+
+TEST_F(MemoryOfTest, LargeMemoryIsFreedElsewhereWhenItIsNoLongerMapped) {
+  serveMemoryOf(off_t{8} << 20);
+  EXPECT_NE(closedBy, 0);
+  EXPECT_NE(closedBy, ::gettid());
+  EXPECT_FALSE(wasMappedAtClose);
+}
+
+TEST_F(MemoryOfTest, SmallMemoryIsClosedAtOnce) {
+  serveMemoryOf(4096);
+  EXPECT_EQ(closedBy, ::gettid());
 }
 
 TEST_F(IncomingMessageTest, ARightThatThereIsNoMemoryForRefusesTheMessageAndLeavesNothing) {

@@ -13,6 +13,7 @@
 #include <chrono>
 #include <cstring>
 #include <new>
+#include <optional>
 #include <unordered_map>
 #include <utility>
 #include <vector>
@@ -29,6 +30,10 @@ namespace {
 
 // Messages taken from one channel in a row before the others get their turn.
 constexpr int kMessageBudget = 8;
+
+// How long those messages may keep the others waiting: a thousand usual ones take that long. Some
+// take long by themselves, like a large property list, and eight of those would add up.
+constexpr std::chrono::milliseconds kLongestTurn{20};
 
 // Connections accepted in a row; the next wake-up goes on.
 constexpr int kAcceptBudget = 16;
@@ -83,6 +88,21 @@ Sent sendReply(int fd, OutgoingReply& reply) noexcept {
       return Sent::failed;
   }
 }
+
+// The time that a channel's turn takes. The clock is read only where a turn may have more than one message.
+class TurnClock {
+ public:
+  void start() noexcept { began_ = std::chrono::steady_clock::now(); }
+  // After a message. Without start() the first one counts for nothing.
+  bool isOver() noexcept {
+    const auto now = std::chrono::steady_clock::now();
+    if (!began_) began_ = now;
+    return now - *began_ >= kLongestTurn;
+  }
+
+ private:
+  std::optional<std::chrono::steady_clock::time_point> began_;
+};
 
 class Channel;
 
@@ -172,25 +192,12 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
     const auto keptAlive = shared_from_this();
     if (pending_ != nullptr && !sendPending(readiness)) return;
     backlog_.turnBegins(std::chrono::steady_clock::now);
+    TurnClock clock;
+    if (backlog_.isLikely()) clock.start();
     for (int taken = 0; taken < kMessageBudget && pending_ == nullptr && owner_ != nullptr; ++taken) {
-      if (isDoor_ && !owner_->mayBeRead(*this)) {
-        // Who has gone does not wait for an answer, nor keep the place of one who does.
-        if (readiness.isOver()) return end();
-        isLimited_ = true;
-        return pause();
-      }
-      const auto received = isDoor_ ? incoming_.peek(fd_->get(), account()) : incoming_.receive(fd_->get());
-      if (received == IncomingMessage::Received::endOfChannel) return end();
-      if (received == IncomingMessage::Received::nothing) {
-        backlog_.foundNothing();
-        break;
-      }
-      const bool answerWanted = incoming_.hasHeader() && incoming_.header().replyPort != kNullPort;
-      serve();
-      if (source_ == nullptr) return;  // paused, or ended
-      // A client that waits for its answer sends nothing meanwhile.
-      if (answerWanted && (isDoor_ || !backlog_.isLikely())) break;
+      if (!takeOne(readiness) || clock.isOver()) break;
     }
+    if (source_ == nullptr) return;  // paused, or ended
     backlog_.turnEnds(std::chrono::steady_clock::now);
     if (owner_ != nullptr && pending_ == nullptr && readiness.isOver() && !readiness.isReadable) {
       end();  // nothing left to read, and nobody left to answer
@@ -202,6 +209,24 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
     ChannelOwner* const owner = owner_;
     close();
     if (owner != nullptr) owner->ended(*this);
+  }
+
+  // Takes a message and serves it. True when one more may be taken in this turn.
+  bool takeOne(Readiness readiness) noexcept {
+    if (isDoor_ && !owner_->mayBeRead(*this)) {
+      // Who has gone does not wait for an answer, nor keep the place of one who does.
+      isLimited_ = !readiness.isOver();
+      isLimited_ ? pause() : end();
+      return false;
+    }
+    const auto received = isDoor_ ? incoming_.peek(fd_->get(), account()) : incoming_.receive(fd_->get());
+    if (received == IncomingMessage::Received::endOfChannel) end();
+    if (received == IncomingMessage::Received::nothing) backlog_.foundNothing();
+    if (received != IncomingMessage::Received::message) return false;
+    const bool answerWanted = incoming_.hasHeader() && incoming_.header().replyPort != kNullPort;
+    serve();
+    // A client that waits for its answer sends nothing meanwhile.
+    return source_ != nullptr && (!answerWanted || (!isDoor_ && backlog_.isLikely()));
   }
 
   // Sends the reply that waited. True when the channel may be read again.

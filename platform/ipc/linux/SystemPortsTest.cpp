@@ -540,13 +540,20 @@ TEST_F(PortsTest, TheWalkEndsAtAnUnknownTypeAndAtADescriptorThatIsCutOff) {
 
 // ---- rights of requests ----
 
-TEST_F(PortsTest, ARightMustBeASeqpacketSocketOfTheUnixFamily) {
+TEST_F(PortsTest, ARightMustBeASeqpacketSocketOfTheUnixFamilyThatDoesNotListen) {
   const std::size_t before = openDescriptors();
   const auto refused = [&](const UniqueFd& fd) {
     Datagram datagram = complexMessage(kKeepRight, 1, 40).add(right());
     datagram.fds = {fd.get()};
     EXPECT_EQ(codeOf(datagram), -304);
   };
+  UniqueFd listening(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+  const sockaddr_un anyName{AF_UNIX, {}};
+  ASSERT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&anyName), sizeof anyName.sun_family),
+            0);
+  ASSERT_EQ(::listen(listening.get(), 1), 0);
+  refused(listening);
+  listening.reset();
   refused(std::move(pair(SOCK_STREAM).first));
   refused(std::move(pair(SOCK_DGRAM).first));
   refused(UniqueFd(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)));
@@ -773,6 +780,28 @@ TEST_F(BusyClientTest, ItsRequestsCostAnotherClientNoMoreThanABudget) {
   EXPECT_TRUE(receiveFrom(otherEnd->get()));
   pump();
   EXPECT_EQ(table.served, 2 * kRequests + 1);
+}
+
+TEST_F(BusyClientTest, RequestsThatTakeLongCostAnotherClientOneOfThem) {
+  clockStep = 0ns;
+  ASSERT_LE(turnsForRequestsThatWait(), 32);
+  table.whileServing = [] { steppedTime += 30ms; };
+  for (int i = 0; i < 2 * 8 + 1; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
+  for (int turn = 0; turn < 2 * 8 + 1; ++turn) {
+    const int served = table.served;
+    loop->run(0s, ReturnAfterSource::yes);
+    EXPECT_EQ(table.served, served + 1) << turn;
+  }
+}
+
+TEST_F(BusyClientTest, OneWayRequestsThatTakeLongCostAnotherClientTwoOfThem) {
+  clockStep = 0ns;
+  table.whileServing = [] { steppedTime += 30ms; };
+  for (int i = 0; i < 16; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho, 0, 24, 0)));
+  loop->run(0s, ReturnAfterSource::yes);
+  EXPECT_EQ(table.served, 2);
+  pump();
+  EXPECT_EQ(table.served, 16);
 }
 
 TEST_F(PortsTest, AClientThatShutsItsChannelIsReadNoMoreAndWakesNobody) {
