@@ -51,7 +51,7 @@ void BegunCalls::markReturned(Place sent) noexcept {
 void BegunCalls::finish(BegunCall& call, std::int32_t code, int systemError) noexcept {
   call.result.code = code;
   call.result.system_error = systemError;
-  call.message = {};
+  call.message = std::vector<std::byte>();  // {} would keep the memory
   call.regions = {};
   finished_.splice(finished_.end(), listOf(call), call.place);
   call.state = BegunCall::State::finished;
