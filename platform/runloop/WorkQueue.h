@@ -46,8 +46,8 @@ class WorkQueue {
   class Timer {
    public:
     virtual ~Timer() = default;  // cancels
-    // Returns false if the system cannot time it, so that it will never fire; true on another thread than the
-    // queue's, where that is not known yet. Throws std::bad_alloc.
+    // Returns false if the system cannot time it, so that it will never fire. Called on another thread than
+    // the queue's, it may return true and still fail later. Throws std::bad_alloc.
     virtual bool activate() = 0;
     virtual void cancel() noexcept = 0;
   };
