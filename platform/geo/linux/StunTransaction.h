@@ -15,8 +15,8 @@
 
 namespace brenvik {
 
-// The times, from the beginning, at which an unanswered request is sent again; the last is when it is given
-// up.
+// The times, counted from the beginning, at which an unanswered request is sent; kStunPatience is when it is
+// given up.
 inline constexpr std::array<std::chrono::milliseconds, 5> kStunSchedule{
     std::chrono::milliseconds{0}, std::chrono::milliseconds{250}, std::chrono::milliseconds{750},
     std::chrono::milliseconds{1750}, std::chrono::milliseconds{3750}};
