@@ -23,7 +23,7 @@ constexpr std::uint32_t kMaxTries = 11;
 // A full backlog tells nobody when there is room again, so it is looked at every few milliseconds.
 constexpr std::uint32_t kLongestKnockPause = 16;
 
-// What connect says when there is nobody, and no resource of ours is short.
+// The errors of connect(2) that mean that nobody listens, rather than that we lack a resource.
 bool meansNobody(int error) noexcept {
   switch (error) {
     case EMFILE:

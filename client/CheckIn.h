@@ -11,8 +11,8 @@
 
 namespace brenvik::client {
 
-// A check-in with its retries that never waits: whoever drives it waits for descriptor() and due(), then lets
-// it go on.
+// A check-in with its retries, which never waits. Its user waits for descriptor() and due(), then calls
+// advance().
 class CheckIn {
  public:
   struct Channel {
@@ -23,15 +23,16 @@ class CheckIn {
   bool isUnderWay() const noexcept { return step_ != Step::none; }
   // Precondition: none is under way.
   void start(const sockaddr_un& address) noexcept;
-  // Goes as far as it can. The code once it is over; on BVMH_OK, takeChannel() has what it gave.
+  // Continues as far as it can without waiting. Returns the code when it has ended; after BVMH_OK,
+  // takeChannel() returns the channel.
   std::optional<std::int32_t> advance() noexcept;
   void abandon() noexcept;
 
   // Readable when advance() has something to read; -1 when only time matters.
   int descriptor() const noexcept { return step_ == Step::awaitReply ? service_.get() : -1; }
-  // Another one for each socket that descriptor() was.
+  // A number that changes with each new socket behind descriptor().
   std::uint64_t serial() const noexcept { return serial_; }
-  // When advance() goes on without it.
+  // When advance() must be called even if descriptor() is not readable.
   Deadline due() const noexcept { return due_; }
   Channel takeChannel() noexcept { return std::move(channel_); }
   // The errno behind the code.
@@ -43,7 +44,7 @@ class CheckIn {
   std::optional<std::int32_t> connect() noexcept;
   std::optional<std::int32_t> ask() noexcept;
   std::optional<std::int32_t> readAnswer() noexcept;
-  // A try has ended: pauses before the next one, or says that there is none.
+  // After a failed try, schedules the next one; returns the code if there is none.
   std::optional<std::int32_t> tryEnded(std::int32_t code) noexcept;
   std::int32_t systemFailure() noexcept;
 

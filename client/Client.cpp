@@ -113,7 +113,7 @@ std::int32_t Client::codeOf(Exchange outcome) const noexcept {
 }
 
 void Client::interrupt() noexcept {
-  if (interrupted_) return;  // whoever set it does the rest
+  if (interrupted_) return;  // the thread that set it does the rest
   const int error = errno;
   ++interrupters_;  // keeps both descriptors from being closed
   interrupted_ = true;
@@ -161,9 +161,9 @@ void Client::waitForWork(Deadline deadline) noexcept {
   if (channel_.isValid() && !calls_.waiting().empty()) entries[0].events |= POLLOUT;
   int time = std::min({deadline, earliest_, checkIn_.due()}).millisecondsForPoll();
   if (!wake_.isValid() && (time < 0 || time > kDeafWait)) time = kDeafWait;
-  // Whoever interrupts from here on knows the descriptor.
+  // From here on, interrupt() knows the descriptor.
   if (interrupted_) return;
-  ::poll(entries.data(), entries.size(), time);  // whatever it says, whoever called us looks
+  ::poll(entries.data(), entries.size(), time);  // the caller checks everything, whatever the result
   if (entries[1].revents != 0) {
     std::uint64_t count = 0;
     [[maybe_unused]] const ssize_t taken = ::read(wake_.get(), &count, sizeof count);

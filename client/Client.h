@@ -17,8 +17,8 @@
 
 namespace brenvik::client {
 
-// One client of the helper: its death-watch port, its channel, and the calls on it. One thread at a time, but
-// for interrupt(). All results are codes of mobile_helper.h.
+// One client of the helper: its death-watch port, its channel, and the calls on it. One thread at a time,
+// except for interrupt(). All results are codes of mobile_helper.h.
 class Client {
  public:
   Client() noexcept;
@@ -26,7 +26,7 @@ class Client {
   Client& operator=(const Client&) = delete;
 
   void setTimeout(std::uint32_t milliseconds) noexcept;
-  // False when the path does not fit a socket address or is empty. Null: the place compiled in.
+  // Returns false if the path is empty or does not fit a socket address. Null: the path compiled in.
   bool setSocket(const char* path) noexcept;
 
   std::int32_t connect() noexcept;
@@ -38,10 +38,10 @@ class Client {
   // On success, *result has what the routine returned; else its region is empty.
   std::int32_t call(const RoutineFacts& routine, std::span<std::byte> message, Regions regions,
                     bvmh_result* result) noexcept;
-  // Any thread, and signal handlers.
+  // May be called on any thread and in signal handlers.
   void interrupt() noexcept;
 
-  // The rest is for calls that do not block. -1: see systemError().
+  // The rest is for calls that do not block. descriptor() returns -1 on failure; see systemError().
   int descriptor() noexcept;
   std::int32_t begin(const RoutineFacts& routine, std::span<const std::byte> message, Regions regions,
                      void* context, bvmh_call* number) noexcept;
@@ -70,7 +70,7 @@ class Client {
   // Sends the message, whose header it completes, and waits for its reply where no begun call is under way.
   Exchange exchangeAlone(const RoutineFacts& routine, std::span<std::byte> message, const Outgoing& request,
                          Deadline deadline, Waiting waiting, Reply* reply) noexcept;
-  // What such a reply says, into the result. The code of the call.
+  // Writes that reply into the result and returns the code of the call.
   std::int32_t finishAlone(const RoutineFacts& routine, const Reply& reply, bvmh_result* result) noexcept;
   Exchange exchange(const RoutineFacts& routine, const Outgoing& request, PortName replyPort,
                     Deadline deadline, Waiting waiting, Reply* reply) noexcept;
@@ -80,16 +80,16 @@ class Client {
   std::int32_t codeOf(Exchange outcome) const noexcept;
   // Waits until there is something to do, an interruption, or the deadline.
   void waitForWork(Deadline deadline) noexcept;
-  // Whether there was an interruption; there is none then any more.
+  // Whether there was an interruption; clears it.
   bool takeInterruption() noexcept;
 
-  // The channel, for both.
+  // Uses the channel, for blocking and begun calls.
   void useChannel(CheckIn::Channel channel) noexcept;
   void closeChannel() noexcept;
   PortName nextReplyPort() noexcept;
   MessageHeader headerOf(const RoutineFacts& routine, PortName replyPort) const noexcept;
   bool isLateAnswer(PortName answered, PortName replyPort) noexcept;
-  // What a good reply holds, into the result.
+  // Writes a good reply into the result.
   std::int32_t readResult(const RoutineFacts& routine, const Reply& reply, bvmh_result* result) noexcept;
 
   // Begun calls, in ClientCalls.cpp.

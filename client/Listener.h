@@ -13,8 +13,8 @@
 
 namespace brenvik::client {
 
-// The listening socket of a named service. A socket file that it made is removed again as long as it is still
-// there.
+// The listening socket of a named service. The destructor removes a socket file that this object made, if it
+// still is this socket's.
 class ServiceSocket {
  public:
   ServiceSocket() = default;
@@ -27,7 +27,7 @@ class ServiceSocket {
   // isLocalSocket(descriptor, Listening::yes). False with errno set when it cannot be made non-blocking and
   // close-on-exec; then the descriptor stays the caller's.
   bool adopt(int descriptor) noexcept;
-  // Gives an adopted descriptor back to whoever gave it.
+  // Gives up an adopted descriptor; its previous owner owns it again.
   void giveBack() noexcept { (void)socket_.release(); }
   int get() const noexcept { return socket_.get(); }
   // The file that it made; empty when it made none.
@@ -46,7 +46,7 @@ class ServiceSocket {
 class Listener {
  public:
   std::int32_t open(const char* directory, unsigned services) noexcept;
-  // Descriptors of listening sockets, -1 for none. They are the listener's on BVMH_OK only.
+  // Takes descriptors of listening sockets, -1 for none. The listener owns them only if this returns BVMH_OK.
   std::int32_t open(int pushes, int notifications) noexcept;
   int descriptor() const noexcept { return poll_.get(); }
   int systemError() const noexcept { return systemError_; }
@@ -76,9 +76,9 @@ class Listener {
   // Whether a service has lost its file since it was last asked.
   bool hasLostName() noexcept;
   std::int32_t accept(Service service) noexcept;
-  // Deals with what is ready, by its key in poll_; true when `*code` is for the caller.
+  // Serves what poll_ reported under this key; returns true if *event or *code has something for the caller.
   bool serve(std::uint64_t key, bvmh_event* event, std::int32_t* code) noexcept;
-  // Reads one message; true when it was one for the caller.
+  // Reads one message; returns true if *event or *code has something for the caller.
   bool read(Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;
   bool readPush(const Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;
   bool readNotification(const Connection& connection, bvmh_event* event, std::int32_t* code) noexcept;

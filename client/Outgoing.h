@@ -18,12 +18,13 @@ inline constexpr std::size_t kMaxRegions = 2;
 
 using Regions = std::span<const std::span<const std::byte>>;
 
-// A request as it is handed to the kernel: the message, then the regions that fit the datagram, each at a
-// multiple of 8; the others in sealed memory of their own. Refers to the bytes it is made of.
+// A request in the form that is passed to the kernel: the message, then the regions that fit the datagram,
+// each at a multiple of 8; the others in sealed memory of their own. It refers to the caller's bytes, which
+// must outlive it.
 class Outgoing {
  public:
-  // Fills in the message's descriptors, one for each region, in their order. False with errno set when memory
-  // cannot be made.
+  // Fills in the message's descriptors, one for each region, in their order. Returns false and sets errno if
+  // sealed memory cannot be made.
   bool lay(std::span<std::byte> message, Regions regions) noexcept;
   std::span<const iovec> parts() const noexcept { return std::span(parts_).first(partCount_); }
   std::span<const int> descriptors() const noexcept {

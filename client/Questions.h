@@ -11,8 +11,8 @@
 
 namespace brenvik::client {
 
-// Which location requests of a client are still to be answered by a push. A push does not name its request,
-// so it can be told only while there is one of its kind.
+// The location requests of a client that no push has answered yet. A push does not name its request, so the
+// match is certain only while there is exactly one of its kind.
 class Questions {
  public:
   using Time = std::chrono::steady_clock::time_point;
@@ -20,9 +20,9 @@ class Questions {
   static constexpr std::chrono::seconds kAnswerTime{10};
 
   static bool isQuestion(std::int32_t routine) noexcept;
-  // For what is no question it does nothing. Number 0: a blocking call.
+  // Records a request; ignores routines that are not location requests. Number 0: a blocking call.
   void asked(std::int32_t routine, bvmh_call number, Time now) noexcept;
-  // The helper refused the request.
+  // Forgets a request that the helper refused.
   void refused(std::int32_t routine, bvmh_call number) noexcept;
   // Result as bvmh_match_push.
   std::int32_t answered(bvmh_event_kind push, Time now, bvmh_call* number) noexcept;

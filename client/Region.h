@@ -11,21 +11,21 @@
 #include "client/include/brenvik/mobile_helper.h"
 #include "interface/Wire.h"
 
-// Out-of-line regions, as they leave and as they come in.
+// Out-of-line regions of received messages.
 namespace brenvik::client {
 
-// Room for one message; a larger datagram arrives cut, which the kernel tells.
+// Room for one message, in bytes; a larger datagram arrives cut, and the kernel reports that.
 inline constexpr std::size_t kBufferSize = kLargestDatagram;
 
-// Where a region of an incoming message stands: in the datagram, in a descriptor, or nowhere (size 0).
+// The place of a region of an incoming message: in the datagram, in a descriptor, or nowhere (size 0).
 struct RegionPlace {
   std::uint32_t size = 0;
   std::size_t offset = 0;  // 0: in the message's first descriptor
 };
 
 // Checks the framing of a message whose fixed part has bodySize bytes and holds one out-of-line descriptor
-// and no other: the region's place, that nothing follows it, and that as many descriptors came as it needs.
-// Nothing when any of it is not as it should be.
+// and no other: the region's place, that nothing follows it, and that the right number of descriptors came.
+// Returns nothing if the message is malformed.
 std::optional<RegionPlace> placeOfRegion(std::span<const std::byte> datagram, std::size_t bodySize,
                                          const Incoming& incoming) noexcept;
 
@@ -36,7 +36,7 @@ class Buffer {
   Buffer(const Buffer&) = delete;
   Buffer& operator=(const Buffer&) = delete;
   ~Buffer();
-  // Makes sure that there is one; false when out of memory.
+  // Allocates the buffer if there is none; false if memory runs out.
   bool ensure() noexcept;
   std::span<std::byte> bytes() const noexcept { return {data_, data_ == nullptr ? 0 : kBufferSize}; }
   [[nodiscard]] void* release() noexcept;
@@ -45,8 +45,9 @@ class Buffer {
   std::byte* data_ = nullptr;
 };
 
-// Hands a region that was placed over to the caller. `buffer` holds the datagram and may be given away with
-// it. BVMH_ERROR_PROTOCOL for memory that is not sealed or shorter than it says.
+// Hands a region over to the caller. `buffer` holds the datagram, and its memory may go to the caller with
+// the region. Returns BVMH_ERROR_PROTOCOL for memory that is not sealed or is shorter than its descriptor
+// says.
 std::int32_t takeRegion(const RegionPlace& place, Buffer& buffer, const Incoming& incoming,
                         bvmh_region* region) noexcept;
 

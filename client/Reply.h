@@ -9,7 +9,7 @@
 #include "client/Region.h"
 #include "interface/Routines.h"
 
-// Reads replies. Nothing in them is believed before it is checked.
+// Reads replies, and checks everything in them before it is used.
 namespace brenvik::client {
 
 struct Reply {
@@ -19,11 +19,11 @@ struct Reply {
   UniqueFd port;                        // form checkIn: a SOCK_SEQPACKET socket
 };
 
-// The reply port number that a message answers; nothing when it is too short to say.
+// Returns the reply port number that a message answers; nothing if the message is too short.
 std::optional<PortName> answeredPort(std::span<const std::byte> datagram) noexcept;
 
-// Checks the reply to a request of that routine and takes it apart. False when any of it is not as the
-// protocol says. The NDR record is not looked at: one routine leaves it unset.
+// Checks and parses the reply to a request of that routine. Returns false if the reply is malformed. It does
+// not check the NDR record, because one routine leaves it unset.
 bool readReply(const RoutineFacts& routine, std::span<const std::byte> datagram, Incoming* incoming,
                Reply* reply) noexcept;
 

@@ -7,14 +7,14 @@
 
 #include "interface/Messages.h"
 
-// One row for each routine: what must be true of a request before its routine runs, and the form of its
-// reply. Handlers, client, command line, fuzzers and the protocol's table all come from here.
+// One row for each routine: the conditions that a request must meet before its routine runs, and the form of
+// its reply. Handlers, client, command line, fuzzers and the protocol's table all use these rows.
 namespace brenvik {
 
 enum class ReplyForm : std::uint8_t { status, integer, string64, string256, outOfLine, checkIn };
 
 constexpr std::size_t sizeOfReply(ReplyForm form) noexcept {
-  // In the order of the forms.
+  // Sizes in bytes, in the order of the forms.
   constexpr std::array sizes{sizeof(StatusReply),    sizeof(IntegerReply),   sizeof(String64Reply),
                              sizeof(String256Reply), sizeof(OutOfLineReply), sizeof(CheckInReply)};
   static_assert(sizes.size() == static_cast<std::size_t>(ReplyForm::checkIn) + 1);
@@ -24,8 +24,8 @@ constexpr std::size_t sizeOfReply(ReplyForm form) noexcept {
 struct RoutineFacts {
   std::int32_t id;
   std::string_view name;
-  std::uint32_t requestSize;
-  std::uint32_t descriptors;    // 0: a simple request; else complex with exactly so many
+  std::uint32_t requestSize;    // bytes, without in-line regions
+  std::uint32_t descriptors;    // 0: a simple request; else a complex one with exactly this many
   std::uint32_t lengthsOffset;  // complex: where the body repeats the descriptors' sizes, u32 each, in order
   ReplyForm reply;
 };
@@ -86,7 +86,7 @@ inline constexpr std::array kRequestRoutines{
                  ReplyForm::integer},
 };
 static_assert(kRequestRoutines.size() == 27);
-// The dispatch indexes the table by id, so the rows stand in the order of their ids, without a hole.
+// The dispatch indexes the table by id, so the rows are in the order of their ids, without gaps.
 static_assert([] {
   for (std::size_t i = 0; i < kRequestRoutines.size(); ++i) {
     if (kRequestRoutines[i].id != kFirstRequestId + static_cast<std::int32_t>(i)) return false;

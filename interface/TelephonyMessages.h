@@ -7,8 +7,8 @@
 
 #include "interface/Wire.h"
 
-// The messages between this helper and the telephony daemon's service, byte for byte. Both programs and their
-// stand-ins take them from here.
+// The messages between this helper and the telephony daemon's services, byte for byte. Both programs and
+// their stand-ins use these definitions.
 namespace brenvik {
 
 inline constexpr const char kTelephonyServiceName[] = "com.norvale.brenvik";
@@ -18,8 +18,8 @@ inline constexpr const char kNotificationServiceName[] = "com.norvale.Brenvik.la
 inline constexpr std::int32_t kSetCivicInfoMessageId = 9100001;
 inline constexpr std::int32_t kSetLocalRoutableAddressMessageId = 9100002;
 
-// The region is a binary property list: a dictionary of kClientKey, an array of strings, and the values
-// pushed, strings too. A value that is absent has no key.
+// The region is a binary property list, a dictionary: kClientKey holds an array of strings, the other keys
+// hold the pushed values as strings. An absent value has no key.
 struct [[gnu::packed]] TelephonyPushMessage {
   MessageHeader header;
   std::uint32_t descriptorCount;
@@ -32,7 +32,7 @@ static_assert(sizeof(TelephonyPushMessage) == 52 && offsetof(TelephonyPushMessag
 struct [[gnu::packed]] TelephonyPushReply {
   MessageHeader header;
   NdrRecord ndr;
-  KernelReturn returnCode;  // anything but 0 is the push's error code
+  KernelReturn returnCode;  // 0, or the push's error code
   std::uint64_t result;     // error domain in the lower half, error code in the upper
 };
 static_assert(sizeof(TelephonyPushReply) == 44 && offsetof(TelephonyPushReply, ndr) == 24 &&

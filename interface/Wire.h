@@ -5,14 +5,14 @@
 #include <cstddef>
 #include <cstdint>
 
-// The elements every message is made of. All integers are little-endian; sizes are in bytes.
+// The elements of every message. All integers are little-endian; sizes are in bytes.
 namespace brenvik {
 
 using PortName = std::uint32_t;
 inline constexpr PortName kNullPort = 0;
 inline constexpr PortName kDeadPort = 0xFFFFFFFF;
 
-// Names a port that can be used: neither null nor dead.
+// True for the name of a port that can be used: neither null nor dead.
 constexpr bool isUsablePort(PortName name) noexcept { return name != kNullPort && name != kDeadPort; }
 
 // Return codes as they cross the interface.
@@ -38,10 +38,10 @@ inline constexpr KernelReturn trailerError = -309;  // receive trailer missing o
 }  // namespace mig
 
 inline constexpr std::uint32_t kComplexBit = 0x80000000;
-inline constexpr std::uint32_t kReplyDisposition = 18;  // a reply is wanted, or this is one
+inline constexpr std::uint32_t kReplyDisposition = 18;  // the message wants a reply, or is one
 inline constexpr std::int32_t kReplyIdOffset = 100;     // a reply carries the request's id plus this
 inline constexpr std::size_t kLargestDatagram = 65536;  // one message, in-line regions included
-inline constexpr std::size_t kRegionAlignment = 8;      // an in-line region starts at a multiple of it
+inline constexpr std::size_t kRegionAlignment = 8;      // an in-line region starts at a multiple of this
 inline constexpr std::uint8_t kDispositionMoveSend = 17;
 inline constexpr std::uint8_t kDispositionCopySend = 19;
 inline constexpr std::uint8_t kPortDescriptorType = 0;
@@ -93,13 +93,13 @@ static_assert(sizeof(OutOfLineDescriptor) == 16 && offsetof(OutOfLineDescriptor,
 inline constexpr std::size_t kDescriptorCountOffset = 24;
 inline constexpr std::size_t kDescriptorsOffset = 28;
 
-// Where the next in-line region starts in a datagram that is filled up to `end`. Bytes. The first one follows
-// the message, the others follow each other.
+// The offset, in bytes, of the next in-line region in a datagram that is filled up to `end`. The first region
+// follows the message, each other one the region before.
 constexpr std::size_t regionOffsetAfter(std::size_t end) noexcept {
   return (end + kRegionAlignment - 1) / kRegionAlignment * kRegionAlignment;
 }
 
-// What the receiving platform appends to a message, at its size rounded up to 4.
+// The receiving platform appends this to a message, at the message's size rounded up to a multiple of 4.
 struct [[gnu::packed]] MessageTrailer {
   std::uint32_t type;
   std::uint32_t size;

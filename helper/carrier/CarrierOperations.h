@@ -18,9 +18,8 @@ namespace brenvik {
 // call does its file work before it returns. Text arguments are fields of the request, of the sizes below;
 // their last byte is overwritten with a NUL. The port is not used. Nothing throws.
 //
-// Two families of result: the link and removal requests answer with their status (5: a system call failed,
-// 8: the path is not allowed); the others always return 0 and answer in the success byte (1 or 0) and the
-// log.
+// The link and removal requests report their result as the status (5: a system call failed, 8: the path is
+// not allowed). The others always return 0, and report it in the success byte (1 or 0) and in the log.
 class CarrierOperations {
  public:
   static constexpr std::size_t kLongField = 1024;
@@ -35,13 +34,12 @@ class CarrierOperations {
         preferences_(preferences),
         account_(std::move(account)) {}
 
-  // Long fields. Replaces whatever is at the link path, but a directory that is not empty; no path is
-  // refused.
+  // Long fields. Replaces any item at the link path but a directory that is not empty. Refuses no path.
   KernelReturn createSymlink(PortName port, char* target, char* linkPath) noexcept;
-  // Long fields. Only for a listed carrier path; then forgets what is cached of the domain, unless it is
-  // empty.
+  // Long fields. Only for a listed carrier path. On success it drops the cached preferences of the domain,
+  // unless that text is empty.
   KernelReturn replaceCarrierSymlink(PortName port, char* target, char* linkPath, char* domain) noexcept;
-  // Long fields. Forgets what is cached of the domain first, even when the path is refused then.
+  // Long fields. Drops the cached preferences of the domain first, even if the path is then refused.
   KernelReturn removeCarrierFile(PortName port, char* path, char* domain) noexcept;
 
   // Short fields. Copies one file into an allowed directory and gives it to the mobile account.
@@ -52,7 +50,7 @@ class CarrierOperations {
   // Short fields. The destination directory is made before its path is judged. `success` may be null.
   KernelReturn moveIntoCarrierBundles(PortName port, char* sourcePath, char* destinationDirectory, char* name,
                                       std::uint8_t* success) noexcept;
-  // Short fields. Writes `success` only when it is true: the caller starts it as false.
+  // Short fields. Writes `success` only to set it to true; the caller must initialise it to false.
   KernelReturn unpackArchive(PortName port, char* archivePath, char* destinationPath,
                              std::uint8_t* success) noexcept;
 

@@ -12,10 +12,10 @@
 #include "interface/Wire.h"
 #include "platform/preferences/PreferencesStore.h"
 
-// What the tests of the carrier requests share.
+// Helpers that the tests of the carrier requests share.
 namespace brenvik {
 
-inline constexpr PortName kPort = 77;  // which the requests do not look at
+inline constexpr PortName kPort = 77;  // any port: the requests do not use it
 
 // A request field: NUL-padded, and full of letters behind its last byte when a test leaves it unterminated.
 template <std::size_t size>
@@ -25,7 +25,7 @@ struct Field : std::array<char, size> {
 using Long = Field<1024>;
 using Short = Field<256>;
 
-// Notes which domains were flushed; holds no values.
+// Records which domains were flushed; holds no values.
 class FlushRecorder final : public PreferencesStore {
  public:
   std::vector<std::optional<std::string>> flushed;

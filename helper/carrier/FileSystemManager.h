@@ -15,7 +15,7 @@ class FileSystemManager final : public FileSystemInterface {
   FileSystemManager(const FileSystemManager&) = delete;
   FileSystemManager& operator=(const FileSystemManager&) = delete;
 
-  // A factory over one file manager, which must outlive it.
+  // Returns a factory that uses this file manager, which must outlive it.
   static FileSystemFactory factory(FileManager& files);
 
   int moveItem(const std::string& source, const std::string& destination) noexcept override;

@@ -8,15 +8,15 @@
 
 namespace brenvik {
 
-// What the carrier routines need to know of the "mobile" account.
+// The facts about the "mobile" account that the carrier routines need.
 struct MobileAccount {
   const char* home =
-      nullptr;  // no trailing slash, lives as long as the process; null: the account has no home
+      nullptr;  // no trailing slash; lives as long as the process; null: the account has no home
   uid_t uid = 0;
   gid_t gid = 0;
 };
 
-// Asked on each use; main thread only.
+// Called for each use, on the main thread only.
 using MobileAccountSource = std::function<MobileAccount()>;
 
 }  // namespace brenvik

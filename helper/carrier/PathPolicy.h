@@ -10,10 +10,10 @@
 
 namespace brenvik {
 
-// Decides which paths of a request may be touched. Two pure predicates: they look at most at the type of what
-// stands at the path and change nothing. Paths are bytes: neither ".." nor links on the way are resolved.
-// The account's home is taken once, at the first question; without a home the entries below it match nothing.
-// Any thread. Memory exhaustion refuses the path.
+// Decides which paths of a request may be touched. Both predicates change nothing and look at most at the
+// type of the item at the path. Paths are compared as bytes: neither ".." nor links are resolved. The first
+// call looks up the account's home; without a home, the entries below it match nothing. Any thread. A lack of
+// memory refuses the path.
 class PathPolicy {
  public:
   explicit PathPolicy(MobileAccountSource account) : account_(std::move(account)) {}
@@ -22,15 +22,15 @@ class PathPolicy {
   // FIFO stands there.
   bool isListedCarrierPath(const char* path) noexcept;
 
-  // True for what begins with one of the two carrier bundle directories, for a listed path, and for a carrier
-  // configuration package below "/tmp". A path of the last kind leaves the lines of a refusal in the log,
-  // too.
+  // True for a path that begins with one of the two carrier bundle directories, for a listed path, and for a
+  // carrier configuration package below "/tmp". A package, although allowed, still logs the lines of a
+  // refusal.
   bool isAllowedCarrierPath(const char* path) noexcept;
 
  private:
   static constexpr std::size_t kEntries = 32;
 
-  // Builds them when they are not there yet; false when there was no memory for it.
+  // Builds the tables if they are missing; false if memory runs out.
   bool hasTables() noexcept;
   void buildTables();
 

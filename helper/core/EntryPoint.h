@@ -9,19 +9,19 @@
 
 namespace brenvik {
 
-// The life of the process from the first service to the exit status: hosts the baseband server where there is
-// one, checks the service name in, serves until the idle rule ends it, and stops the hosted server. 0, or 1
-// when the service could not be set up (which is logged). Main thread.
+// Runs the helper: hosts the baseband server if there is one, checks the service name in, serves until the
+// idle rule ends it, and stops the hosted server. Returns the exit status: 0, or 1 if the service could not
+// be set up (which is logged). Main thread.
 //
-// `endWork` runs when serving is over and the server still stands: it ends the work of other threads, which
-// gives its busy tokens back to that server. `beginWork`, where there is one, runs with the server before it
-// serves.
+// `beginWork`, which may be empty, runs with the server before it serves. `endWork` runs after serving, while
+// the server still exists: it ends the work of other threads, which give their busy tokens back to the
+// server.
 int runHelper(BasebandLibrary& baseband, const ServerPlatform& platform, const RoutineTable& requests,
               const std::function<void()>& endWork,
               const std::function<void(ServerContext&)>& beginWork = {});
 
-// Runs the process's work and returns its exit status; an exception that comes out of it is logged as the
-// failure to start that it is, and becomes 1. The log sink must outlive this call.
+// Runs `work` and returns its exit status. If `work` throws, the exception is logged as a failure to start,
+// and the status is 1. The log sink must outlive this call.
 int runReportingFailure(const std::function<int()>& work) noexcept;
 
 }  // namespace brenvik

@@ -17,10 +17,10 @@
 
 namespace brenvik {
 
-// What the helper tells about itself, gathered when somebody asks. Main loop only.
+// The helper's report about itself, gathered for each request. Main loop only.
 class HelperStatus {
  public:
-  // What it asks; all of it outlives this object.
+  // The sources of the report; all must outlive this object.
   struct Sources {
     const ServerContext& server;
     const LASDUpdater& lasd;
@@ -28,7 +28,7 @@ class HelperStatus {
     const GeoRequestState& location;
     std::string version;
     std::string socket;  // of the service
-    // Processes that work for the helper, and whether each runs at this moment.
+    // The helper's worker processes, and whether each runs now.
     std::function<std::vector<StatusReport::Worker>()> workers = {};
     std::function<ProgramFacts()> program = programFacts;
     std::function<std::chrono::nanoseconds()> now = timeSinceBoot;
@@ -37,7 +37,7 @@ class HelperStatus {
   explicit HelperStatus(Sources sources) : sources_(std::move(sources)), began_(sources_.now()) {}
 
   StatusReport report() const;
-  // What keeps the helper, in one line for the service manager.
+  // One line for the service manager: what keeps the helper alive.
   std::string line() const;
 
  private:

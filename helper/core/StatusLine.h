@@ -12,15 +12,16 @@
 
 namespace brenvik {
 
-// Keeps the line that the service manager shows up to date: a second after a change, with whatever else has
-// changed by then, so at most once a second, and never while a reply is awaited. Without a service manager
-// that listens it does nothing. Made and destroyed on the main loop.
+// Keeps the status line that the service manager shows up to date. It sends the line one second after a
+// change, so at most once a second, and never while a client waits for a reply. If no service manager
+// listens, it does nothing. Construct and destroy it on the main loop.
 class StatusLine {
  public:
-  // `line` makes the text, on the main loop; it may throw std::bad_alloc. What is given outlives this object.
+  // `line` makes the text, on the main loop; it may throw std::bad_alloc. The arguments must outlive this
+  // object.
   StatusLine(WorkQueues& queues, ServiceManager& manager, std::function<std::string()> line);
 
-  // Any thread.
+  // Call it after a change. Any thread.
   void changed() noexcept;
 
  private:
@@ -30,7 +31,7 @@ class StatusLine {
   ServiceManager& manager_;
   const std::function<std::string()> line_;
   std::string shown_;                        // main loop only
-  std::atomic<bool> isUnderWay_{false};      // somebody will look
+  std::atomic<bool> isUnderWay_{false};      // an update is already scheduled
   const std::shared_ptr<StatusLine*> self_;  // tasks hold it weakly
 };
 

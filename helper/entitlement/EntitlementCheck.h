@@ -15,29 +15,29 @@
 
 namespace brenvik {
 
-// Whether a caller holds a boolean entitlement. The security service is asked once a process: what it grants
-// is remembered until that process exits. What it does not grant is not remembered. Any thread.
+// Tells whether a caller holds a boolean entitlement. A grant of the security service is remembered until the
+// caller's process exits; a refusal is not remembered. Any thread.
 class EntitlementCheck {
  public:
-  // Both must outlive the last call of HasEntitlement. Processes are watched through `queues`; after this
-  // object is gone their exits are of no interest. `now` counts on, from any beginning: refusals are told at
-  // times.
+  // `security` and `queues` must outlive the last call of HasEntitlement. `queues` watches the processes for
+  // their exit; watching ends with this object. `now` is any clock that only moves forward; it limits how
+  // often refusals are logged.
   EntitlementCheck(TaskSecurity& security, WorkQueues& queues, RefusalLog::Clock now = steadyTime);
   EntitlementCheck(const EntitlementCheck&) = delete;
   EntitlementCheck& operator=(const EntitlementCheck&) = delete;
-  ~EntitlementCheck();  // as tearDown
+  ~EntitlementCheck();  // does what tearDown does
 
-  // True when the caller holds it with the value true. False, too, when there is no such caller, when the
-  // service could not answer, or when the value is no boolean; the log then says why, see RefusalLog.h.
+  // True if the caller holds the entitlement with the value true. False also if there is no such caller, the
+  // service could not answer, or the value is not a boolean; the log then has the reason, see RefusalLog.h.
   bool HasEntitlement(std::string_view name, const AuditToken& caller) noexcept;
 
-  // Who a caller is that was granted something, for the lines that its requests cause; null when not known.
+  // Describes a caller that holds a grant, for the log lines that its requests cause; null if unknown.
   std::shared_ptr<const LogCaller> describe(const AuditToken& caller) const noexcept;
 
-  // Stops watching and forgets every grant, for good: from then on each question goes to the service.
+  // Stops watching and forgets every grant, for good. Later calls ask the service each time.
   void tearDown() noexcept;
 
-  // How many grants are remembered, and how many processes are watched.
+  // The number of remembered grants, and of watched processes.
   std::size_t grants() const noexcept;
   std::size_t watchers() const noexcept;
 
@@ -48,7 +48,7 @@ class EntitlementCheck {
 
   TaskSecurity& security_;
   WorkQueues& queues_;
-  const std::shared_ptr<State> state_;  // an exit handler that is late finds it, or finds it gone
+  const std::shared_ptr<State> state_;  // late exit handlers hold it weakly
   RefusalLog refusals_;
 };
 

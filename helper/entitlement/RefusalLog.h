@@ -18,9 +18,9 @@
 
 namespace brenvik {
 
-// Tells of refused callers in the log, and lets nobody fill it. A caller, here an account with an executable,
-// gets a line for its first refusal, and then one a minute at most, with the number of those that had none.
-// Beyond so many callers at a time, all further ones count as one. Any thread.
+// Logs refused callers without letting them fill the log. A caller is an account with an executable. It gets
+// a line for its first refusal, and then at most one a minute, with the number of refusals that were not
+// logged. Beyond kMaxCallers callers at a time, all others count as one. Any thread.
 class RefusalLog {
  public:
   using Clock = std::function<std::chrono::nanoseconds()>;
@@ -30,18 +30,17 @@ class RefusalLog {
 
   explicit RefusalLog(Clock now) : now_(std::move(now)) {}
 
-  // A caller was refused. `why` is asked only when a line is written. Throws std::bad_alloc.
+  // Records that a caller was refused. `why` is called only if a line is written. Throws std::bad_alloc.
   void refused(const LogCaller& caller, const char* entitlement, const std::function<std::string()>& why);
 
-  // Writes the numbers that are still to be told, and forgets every caller.
+  // Logs the counts that were not logged yet, and forgets every caller.
   void flush() noexcept;
 
  private:
-  // Without initialisers and without allocations: what is never used costs nothing, and a lack of memory
-  // leaves no traces.
+  // No initialisers and no allocations: an unused entry costs nothing, and a lack of memory changes nothing.
   struct Account {
     uid_t uid;
-    std::array<char, 256> executable;  // its beginning, with a NUL
+    std::array<char, 256> executable;  // the beginning of its path, with a NUL
     std::chrono::nanoseconds told;
     std::uint64_t untold;
   };
@@ -49,7 +48,7 @@ class RefusalLog {
     std::chrono::nanoseconds told{};
     std::uint64_t untold = 0;
   };
-  // Counts the refusal, and says whether it is to be written.
+  // Counts the refusal; true if it must be logged.
   bool count(const LogCaller& caller);
   Account* find(const LogCaller& caller) noexcept;
   void dropThoseOfLongAgo(std::chrono::nanoseconds now) noexcept;
@@ -60,7 +59,7 @@ class RefusalLog {
   std::mutex mutex_;
   std::optional<Others> others_;
   std::size_t count_ = 0;
-  std::array<Account, kMaxCallers> callers_;  // last: pages that nobody touches until somebody is refused
+  std::array<Account, kMaxCallers> callers_;  // last: its pages stay untouched until a caller is refused
 };
 
 }  // namespace brenvik

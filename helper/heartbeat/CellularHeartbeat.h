@@ -16,11 +16,11 @@ namespace brenvik {
 // The destination compiled in, an IPv4 address in dotted-decimal form.
 extern const char* const kReachabilityAddress;
 
-// Keeps the cellular data link awake: one ICMP echo request every two seconds by the interface pdp_ip0 while
-// switched on, and a busy token held for as long. Nobody is told whether a request was answered.
+// Keeps the cellular data link awake: while it is on, it sends one ICMP echo request every two seconds over
+// the interface pdp_ip0 and holds a busy token. Nobody is told whether a request was answered.
 class CellularHeartbeat {
  public:
-  // What it works with; all of it outlives the heartbeat, or its shutDown().
+  // The heartbeat's dependencies, which must outlive it or its shutDown().
   struct Parts {
     WorkQueues& queues;
     EchoNetwork& network;
@@ -30,25 +30,25 @@ class CellularHeartbeat {
   CellularHeartbeat() noexcept = default;
   CellularHeartbeat(const CellularHeartbeat&) = delete;
   CellularHeartbeat& operator=(const CellularHeartbeat&) = delete;
-  // As shutDown().
+  // Does what shutDown() does.
   ~CellularHeartbeat();
 
-  // The process's own, made before main() begins. It costs nothing until it is first switched on.
+  // The process's own heartbeat, made before main() begins. It costs nothing until it is first switched on.
   static CellularHeartbeat& shared() noexcept;
 
-  // To be called once, before anything else.
+  // Call it once, before anything else.
   void configure(Parts parts);
 
-  // Switches it on or off, and returns at once. Main loop only; a server that was switched on for outlives
-  // the heartbeat. Switched on twice, it takes a second token and forgets the first, which stays taken. Where
-  // its timer cannot be armed it is off again, its token is given back, and a line says so.
+  // Switches it on or off, and returns at once. Main loop only; the server must outlive the heartbeat. If it
+  // is switched on twice, it takes a second token and forgets the first, which stays taken. If its timer
+  // cannot be armed, it logs that, switches itself off and gives the token back.
   void setHeartbeat(ServerContext& server, bool enable);
 
-  // Ends the queue after the probe that runs, which takes up to two seconds; tokens stay taken. Main loop
+  // Waits for the probe that is running (up to two seconds) and ends the queue; tokens stay taken. Main loop
   // only.
   void shutDown() noexcept;
 
-  // Whether it is on, and what went out and came back since the process began. Any thread.
+  // Whether it is on, and the packets sent and received since the process began. Any thread.
   struct Traffic {
     std::uint64_t packets = 0;
     std::uint64_t bytes = 0;  // of ICMP messages
@@ -57,8 +57,8 @@ class CellularHeartbeat {
   Traffic sent() const noexcept { return sent_.read(); }
   Traffic received() const noexcept { return received_.read(); }
 
-  // One probe, up to two seconds: sends a request and waits for its reply. 0, or what went wrong as an errno
-  // number; ENOMEM when memory did not suffice. On the heartbeat's queue, or with none running.
+  // Sends one request and waits for its reply, up to two seconds. Returns 0 or an errno; ENOMEM if memory ran
+  // out. Call it on the heartbeat's queue, or while that has no tasks.
   int ping() noexcept;
 
  private:
@@ -89,7 +89,7 @@ class CellularHeartbeat {
   std::unique_ptr<WorkQueue::Timer> timer_;
   std::uint32_t busyToken_ = 0;
   ServerContext* server_ = nullptr;
-  // Last, so that it ends first: its tasks use everything above.
+  // Declared last, so that it is destroyed first: its tasks use everything above.
   std::shared_ptr<WorkQueue> queue_;
 };
 

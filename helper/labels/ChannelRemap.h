@@ -12,7 +12,7 @@ namespace brenvik {
 // The request that lets contacts follow a line whose channel identifier changes. Main loop only.
 class ChannelRemap {
  public:
-  // The service outlives the object.
+  // The service must outlive the object.
   explicit ChannelRemap(ContactsService& contacts) noexcept : contacts_(contacts) {}
 
   // `from` and `to` are fields of 64 bytes that need not be terminated. Always kern::success; *success is 1

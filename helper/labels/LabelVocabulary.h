@@ -8,9 +8,9 @@
 
 namespace brenvik {
 
-// The labeler's identifier (platform/labeler/SubscriptionLabeler.h) for one of Brenvik's six label keys, or
-// no value when the key is none of them. Keys are compared exactly. The first call may throw std::bad_alloc;
-// the next one then is the first again. Any thread.
+// Returns the labeler's identifier (platform/labeler/SubscriptionLabeler.h) for one of Brenvik's six label
+// keys; no value for any other key. Keys are compared exactly. May throw std::bad_alloc until a call has
+// succeeded. Any thread.
 PropertyList labelIdentifierForKey(std::string_view key);
 
 }  // namespace brenvik

@@ -13,10 +13,11 @@ namespace brenvik {
 
 inline constexpr const char kDatabaseDirectory[] = "/var/mobile/Library/LASD";
 
-// Puts one database in place and records its version. Blocks while it downloads; one thread at a time.
+// Downloads and installs one database and records its version. Blocks while it downloads; one thread at a
+// time.
 class DatabaseInstaller {
  public:
-  // What it works with; all of it outlives the installer.
+  // The installer's dependencies, which must outlive it.
   struct Parts {
     HttpFetcher::Parts fetcher;
     PreferencesStore& preferences;
@@ -25,10 +26,10 @@ class DatabaseInstaller {
 
   explicit DatabaseInstaller(Parts parts) : parts_(std::move(parts)) {}
 
-  // Downloads the gzip file, never over cellular, puts it uncompressed in place of an older one, and then
-  // stores `record` as the type's version record. True when both are done. A failure on the way leaves the
-  // older record, so that the next check tries again, unless the server has gone back to that version by
-  // then. The previous file is removed before the new one is moved in, so that for a moment there is none.
+  // Downloads the gzip file, never over cellular, replaces the older database with its contents, and then
+  // stores `record` as the type's version record. Returns true if both are done. After a failure the old
+  // record stays, so the next check tries again (unless the server has gone back to that version). The old
+  // file is removed before the new one is moved in, so for a moment there is none.
   bool downloadAndInstall(const std::string& url, std::int32_t type, const PropertyList& record);
 
  private:
@@ -37,8 +38,8 @@ class DatabaseInstaller {
   const Parts parts_;
 };
 
-// The name of the file that a URL's database is kept in: what follows the last '/', up to the first ".gz".
-// Empty when that names no file.
+// Returns the file name for a URL's database: the text after the last '/', up to the first ".gz". Empty if
+// that is not a file name.
 std::string databaseFileName(const std::string& url);
 
 }  // namespace brenvik

@@ -21,22 +21,22 @@ struct DiskSpace {
   std::uint64_t size = 0;
   std::uint64_t available = 0;
 };
-// The one that an open file stands on; nothing is available where that cannot be told.
+// The space of the file system that holds an open file; nothing is available if that cannot be found out.
 DiskSpace diskSpaceOf(int file) noexcept;
 
-// What unpacking leaves free of a file system of this size: other programs keep their state there. 16 MiB,
-// and of a small one 2 %, or nothing would ever be installed there.
+// The bytes that unpacking leaves free on a file system of this size, because other programs keep their state
+// there: 16 MiB, or 2 % of a small file system, where 16 MiB would leave no room for a database.
 constexpr std::uint64_t diskReserve(std::uint64_t size) noexcept {
   return std::min(std::uint64_t{16} << 20, size / 50);
 }
 
 enum class WifiOnly : bool { no, yes };
 
-// Downloads one URL into memory and can then write what came, gunzipped, to a file. Made for one fetch, on
-// the caller's stack. One thread at a time.
+// Downloads one URL into memory, and can then write the body, gunzipped, to a file. Make one on the stack for
+// each fetch. One thread at a time.
 class HttpFetcher {
  public:
-  // What it works with; all of it outlives the fetcher.
+  // The fetcher's dependencies, which must outlive it.
   struct Parts {
     WorkQueues& queues;
     WebClient& web;
@@ -48,16 +48,16 @@ class HttpFetcher {
   HttpFetcher(const HttpFetcher&) = delete;
   HttpFetcher& operator=(const HttpFetcher&) = delete;
 
-  // Blocks until the HTTP client reports, without a limit of its own. True when a body came that is not
-  // empty; one of more than `largestBody` bytes is a failure. Fails at once on this object's own queue, which
-  // it would block.
+  // Blocks until the HTTP client reports, without a time limit of its own. Returns true if a body arrived
+  // that is not empty; a body of more than `largestBody` bytes is a failure. Fails at once if called on this
+  // object's own queue, which it would block.
   bool fetch(const std::string& url, WifiOnly wifiOnly, std::uint64_t largestBody = kLargestWebBody) noexcept;
 
-  // Writes the body, which must have been delivered as a gzip file, uncompressed to the path. The file is on
-  // the disk when this returns true; when it returns false, there is none.
+  // Writes the body, which must be a gzip file, uncompressed to the path. If this returns true, the file is
+  // on the disk; if false, there is no file.
   bool uncompressTo(const std::string& path);
 
-  // The body, as long as this object lives and fetches nothing else.
+  // The body; valid until the next fetch or the end of this object.
   std::span<const std::byte> bodyAsData() const noexcept { return body_; }
 
  private:

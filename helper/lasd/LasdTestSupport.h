@@ -28,8 +28,8 @@ inline std::string contentOf(const std::filesystem::path& path) {
   return {std::istreambuf_iterator<char>(file), {}};
 }
 
-// Real queues, but for the updater's, which runs when the test says so: fetches block it, and their answers
-// come on threads of their own.
+// Real queues, except the updater's, which runs when the test says so. Fetches block that queue; their
+// answers arrive on real threads.
 class LasdTestQueues final : public WorkQueues {
  public:
   WorkQueue& main() noexcept override { return system_.main(); }
@@ -68,7 +68,7 @@ class LasdTest : public testing::Test {
   void TearDown() override {
     if (!folder.empty()) std::filesystem::remove_all(folder);
   }
-  // Room for everything, whatever the disk of the machine has.
+  // A disk with room for everything, whatever the machine has.
   static DiskSpace roomyDisk(int) { return {std::uint64_t{1} << 40, std::uint64_t{1} << 40}; }
   HttpFetcher::Parts fetcherParts(std::function<DiskSpace(int)> diskSpace = roomyDisk) {
     return {queues, web, gunzip, std::move(diskSpace)};

@@ -11,12 +11,12 @@ namespace brenvik {
 
 enum class NotificationKind : std::int32_t { updateAvailable = 0, noUpdateRequired = 1, updateFailed = 2 };
 
-// What the telephony daemon is told of an update check. Only updateAvailable says which database; a type that
-// has no name is left out there too.
+// Makes the notification for the telephony daemon about an update check. Only updateAvailable names the
+// database, and only if the type has a name. Throws std::bad_alloc.
 PropertyList makeNotification(NotificationKind kind, std::int32_t type);
 
-// Sends it, as a binary property list, to the telephony daemon's message port. Waits for nothing; when nobody
-// listens it is dropped.
+// Sends it, as a binary property list, to the telephony daemon's message port. Never waits; drops it if
+// nobody listens.
 void sendNotification(MessagePorts& ports, const PropertyList& notification);
 
 }  // namespace brenvik

@@ -6,8 +6,8 @@
 
 namespace brenvik {
 
-// Whether two versions (UTF-8) say the same: letters are compared without regard to case, each run of ASCII
-// digits by its value. "2.0" is "2.00", but not "2".
+// Whether two versions (UTF-8) are equal. Letters are compared without case, runs of ASCII digits by value:
+// "2.0" equals "2.00", but not "2". Any thread.
 bool sameVersion(std::string_view left, std::string_view right) noexcept;
 
 }  // namespace brenvik

@@ -10,10 +10,10 @@
 
 namespace brenvik {
 
-// A fresh connection to Brenvik in this program's name; null when none can be made.
+// Opens a new connection to Brenvik in this program's name; returns null if that fails.
 std::unique_ptr<TelephonyDaemonConnection> openBrenvik(TelephonyDaemon& daemon);
 
-// The text as the platform takes it; absent when it is not valid UTF-8.
+// Returns the text if it is valid UTF-8, else nothing.
 std::optional<std::string> platformString(const std::string& text);
 
 }  // namespace brenvik

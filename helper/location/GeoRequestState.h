@@ -14,7 +14,8 @@
 
 namespace brenvik {
 
-// What all geo requests of a process share: their queue, and whether an answer is awaited. Any thread.
+// The state that all geo requests of a process share: their queue, and whether an answer is awaited. Any
+// thread.
 class GeoRequestState {
  public:
   // The state of this process. Its queue, if any, is released at process exit.
@@ -23,15 +24,15 @@ class GeoRequestState {
   // The serial queue "GEO callback queue", made exactly once, on the first call.
   std::shared_ptr<WorkQueue> geoCallbackQueue(WorkQueues& queues);
 
-  // True from a request's submission until the first answer or time-out, whichever request it belongs to:
-  // requests have no identity, so of overlapping ones the first event does the work and the rest is dropped.
+  // True from a request's submission until the first answer or time-out of any request. Requests have no
+  // identity: if several overlap, the first event does the work and the others are dropped.
   bool isAwaitingGeoResponse() const noexcept { return awaitingGeoResponse_.load(std::memory_order_relaxed); }
   void setAwaitingGeoResponse(bool awaiting) noexcept {
     awaitingGeoResponse_.store(awaiting, std::memory_order_relaxed);
   }
 
-  // How the last request ended, and when by timeSinceBoot(): by the geo service's answer, by its error, or
-  // without either in time. Nothing of what was asked or answered.
+  // How the last request ended (the geo service's answer, its error, or neither in time), and when, by
+  // timeSinceBoot(). It keeps nothing of the question or the answer.
   enum class Ending : std::uint8_t { answered, failed, timedOut };
   struct LastEnding {
     Ending ending = Ending::answered;
@@ -51,8 +52,8 @@ class GeoRequestState {
   std::optional<LastEnding> lastEnding_;  // with endingMutex_
   std::once_flag queueMade_;
   std::shared_ptr<WorkQueue> queue_;
-  // Relaxed, and deliberately no exchange: an event reads it once and clears it once, and nothing is ordered
-  // by it.
+  // Relaxed and, deliberately, without an exchange: an event reads it once and clears it once, and it orders
+  // nothing else.
   std::atomic<bool> awaitingGeoResponse_{false};
 };
 

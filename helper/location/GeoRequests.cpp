@@ -70,7 +70,7 @@ std::string GeoRequests::currentCountryCode() {
 void GeoRequests::requestCivicInfoFromLatitudeLongitude(double latitude, double longitude) {
   auto info = std::make_shared<CivicInfo>();
   if (latitude == 0.0 && longitude == 0.0) {
-    // What a caller without a position sends. Nothing is submitted, so nothing is awaited.
+    // A caller without a position sends zeros. Nothing is submitted, so no answer is awaited.
     postToMainQueue(&GeoRequests::pushCivicFallback);
     return;
   }

@@ -16,12 +16,12 @@
 
 namespace brenvik {
 
-// The work behind the location routines, shared by the queued tasks that carry it on. A request is submitted
-// to the geo service on the GEO callback queue; its answer comes back there, its time-out on the main queue,
-// and the first of them to find an answer awaited pushes to the telephony daemon.
+// The work behind the location routines; its queued tasks share ownership. A request is submitted to the geo
+// service on the GEO callback queue. Its answer arrives on that queue, its time-out on the main queue. The
+// first of them that finds an answer awaited pushes to the telephony daemon.
 class GeoRequests : public std::enable_shared_from_this<GeoRequests> {
  public:
-  // The references are used until close() returns and not afterwards.
+  // The references are not used after close() has returned.
   GeoRequests(WorkQueues& queues, GeoService& geoService, TelephonyDaemon& telephonyDaemon,
               GeoRequestState& state)
       : queues_(queues), geoService_(geoService), telephonyDaemon_(telephonyDaemon), state_(state) {}
@@ -30,18 +30,19 @@ class GeoRequests : public std::enable_shared_from_this<GeoRequests> {
   // or not at all if close() comes first. Main loop.
   void dispatch(WorkQueue::Task workItem);
 
-  // Waits for the task that runs on the GEO callback queue; none starts afterwards. Main loop.
+  // Waits for the task that is running on the GEO callback queue; no task starts afterwards. Main loop.
   void close() noexcept;
 
   // GEO callback queue only.
   void requestCivicInfoFromLatitudeLongitude(double latitude, double longitude);
   void requestWanIpFromLocation();
 
-  // The country configuration's code; empty, and a line in the log, when none is known. Any thread.
+  // Returns the country configuration's code. If none is known, logs that and returns an empty text. Any
+  // thread.
   std::string currentCountryCode();
 
  private:
-  // What a reverse-geocode request has found so far; the request and its handler share it.
+  // The findings of a reverse-geocode request so far; the request and its handler share them.
   struct CivicInfo {
     std::string countryCode;
     std::string state;
@@ -52,12 +53,12 @@ class GeoRequests : public std::enable_shared_from_this<GeoRequests> {
   // Runs the task on the GEO callback queue, unless close() comes first. Any thread.
   void postToGeoCallbackQueue(WorkQueue::Task task);
   std::shared_ptr<WorkQueue> geoCallbackQueue() { return state_.geoCallbackQueue(queues_); }
-  // Reads the flag once and, when it was set, clears it once; returns what was read.
+  // Reads the flag once, clears it if it was set, and returns what it read.
   bool takeAwaitedResponse() noexcept;
-  // Sets the flag and puts the fallback on the main queue, five seconds from now.
+  // Sets the flag and schedules the fallback on the main queue, five seconds from now.
   void awaitGeoResponse(void (GeoRequests::*fallback)());
   void postToMainQueue(void (GeoRequests::*step)());
-  // Runs the push here, or on the GEO callback queue when this is the main queue.
+  // Runs the push here, or, if this is the main queue, on the GEO callback queue.
   void pushOffMainQueue(WorkQueue::Task push);
 
   void handleMapItems(CivicInfo& info, const std::optional<MapItems>& items,

@@ -14,24 +14,24 @@ namespace brenvik {
 class GeoRequestState;
 class GeoRequests;
 
-// The location routines. Each answers at once; what was asked for reaches the telephony daemon later, in a
-// push of its own. Main loop only, its construction and destruction included.
+// The location routines. Each replies at once; the telephony daemon gets the result later, in a push. Main
+// loop only, construction and destruction included.
 class LocationRoutines {
  public:
-  // The references outlive this object. Cheap: nothing is opened, and no thread is started.
+  // The references must outlive this object. Cheap: opens nothing and starts no thread.
   LocationRoutines(WorkQueues& queues, GeoService& geoService, TelephonyDaemon& telephonyDaemon,
                    GeoRequestState& state);
   LocationRoutines(const LocationRoutines&) = delete;
   LocationRoutines& operator=(const LocationRoutines&) = delete;
-  // Waits for the request work that runs at this moment (a second at most, while it talks to the telephony
-  // daemon) and drops the rest.
+  // Waits for the request work that is running (at most a second, while it talks to the telephony daemon) and
+  // drops the rest.
   ~LocationRoutines();
 
   // 8683567: push the civic address of the coordinate (degrees). Always succeeds.
   KernelReturn requestCountryCodeFromLocation(PortName port, double latitude, double longitude);
-  // 8683568: the current country code; all 64 bytes are written, and a text that fills them has no NUL.
+  // 8683568: writes the current country code and fills all 64 bytes; a text of 64 bytes has no NUL.
   KernelReturn copyCountryCode(PortName port, char* countryCode);
-  // 8683569: push the address under which this device is seen from outside. Always succeeds.
+  // 8683569: push this device's public address. Always succeeds.
   KernelReturn requestWanIPFromLocation(PortName port);
 
  private:

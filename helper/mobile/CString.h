@@ -7,11 +7,11 @@
 
 namespace brenvik {
 
-// Where C strings come from and go back to.
+// Allocates and frees C strings.
 class CStringAllocator {
  public:
   virtual ~CStringAllocator() = default;
-  virtual void* allocate(std::size_t size) noexcept = 0;  // null when there is no memory
+  virtual void* allocate(std::size_t size) noexcept = 0;  // null if memory runs out
   virtual void deallocate(void* block) noexcept = 0;
 };
 
@@ -23,11 +23,12 @@ enum class StringEncoding {
   ascii,  // '?' for each character that ASCII lacks
 };
 
-// A NUL-terminated copy of a platform string (UTF-8). It goes into `buffer` when there is one, *size is not 0
-// and the whole text fits there with its NUL; otherwise into a new block of the allocator, which the caller
-// deallocates (it is the one that differs from `buffer`). *size, where given, is the buffer's size on entry
-// and the text's length, without the NUL, on return. Without memory the result is `buffer` (null included),
-// holding the empty string, and *size is 0: a buffer, whatever *size says, has room for one byte. Any thread.
+// Returns a NUL-terminated copy of a platform string (UTF-8). The copy goes into `buffer` if that is not
+// null, *size is not 0, and the whole text fits with its NUL. Otherwise it goes into a new block of the
+// allocator, which the caller must deallocate if the result differs from `buffer`. If `size` is not null,
+// *size is the buffer's size in bytes on entry and the text's length without the NUL on return. If memory
+// runs out, the result is `buffer` (null included) holding the empty string, and *size is 0; so `buffer` must
+// have room for one byte, whatever *size says. Any thread.
 char* GetOrCreateCString(CStringAllocator& allocator, std::string_view text, char* buffer, std::size_t* size,
                          StringEncoding encoding) noexcept;
 

@@ -12,9 +12,9 @@
 
 namespace brenvik {
 
-// The "mobile" account, under which the telephony daemon and user data live. Looked up once, by whichever
-// accessor is called first; the answer never changes afterwards. Any thread. A look-up that lacks memory
-// throws std::bad_alloc and gives no answer; the next one is the first again.
+// The "mobile" account, which owns the telephony daemon and user data. The first accessor called looks it up;
+// the answer never changes afterwards. Any thread. If memory runs out, the accessor throws std::bad_alloc,
+// and the next call looks the account up again.
 class MobileUser {
  public:
   // `accounts` and `allocator` must outlive this object.
@@ -24,14 +24,14 @@ class MobileUser {
   MobileUser& operator=(const MobileUser&) = delete;
   ~MobileUser();
 
-  // The path of its home directory, without a trailing slash (but for "/"), or null when there is none: to be
-  // treated as absent. Lives as long as this object.
+  // The path of its home directory, without a trailing slash (except "/"); null if there is none. Valid as
+  // long as this object lives.
   const char* homeDirectory();
-  // 0 when there is no such account.
+  // 0 if there is no such account.
   uid_t uid();
   gid_t gid();
 
-  // The process's one object, made on first use with the directory of that first call and never destroyed.
+  // The process's one object. The first call makes it, with its `accounts`; it is never destroyed.
   static MobileUser& shared(AccountDirectory& accounts);
 
  private:

@@ -13,35 +13,35 @@
 
 namespace brenvik {
 
-// Reads the file at the path as a dictionary property list; no value when it is missing, unreadable or
-// anything else. What it needs lives for one call. May throw std::bad_alloc.
+// Reads the file at the path as a dictionary property list; returns no value if it is missing, unreadable or
+// not a dictionary. Keeps nothing between calls. May throw std::bad_alloc.
 using DictionaryReader = std::function<PropertyList(const char* path)>;
 
 // The routines that carry preference values and property-list files between the helper and its callers.
 // Main loop only; keeps nothing between requests.
 //
-// Text arguments are the 256-byte fields of the request: each is ended by force at its last byte. `port` is
-// not looked at. The status is a kernel-style code: 5 also for a lack of memory, and the allocator's own code
-// where the region of a payload is refused. A payload is made only with success.
+// Text arguments are the 256-byte fields of the request; the last byte of each is overwritten with a NUL.
+// `port` is not used. The status is a kernel-style code: 5 on failure, also for a lack of memory; the
+// allocator's code if it refuses the region of a payload. A payload is made only on success.
 class PreferenceTransfer {
  public:
-  // The references outlive the object.
+  // The references must outlive the object.
   PreferenceTransfer(PreferencesStore& preferences, RegionAllocator& regions, DictionaryReader readDictionary)
       : preferences_(preferences), regions_(regions), readDictionary_(std::move(readDictionary)) {}
 
   // Stores the property list serialized in these bytes (any format) under the key, for the current user on
-  // any host. A single byte, whatever it is, removes the key. The bytes stay the caller's.
+  // any host. A single byte of any value removes the key. The caller still owns the bytes.
   KernelReturn setPreferenceValue(PortName port, char* domain, char* key, const void* valueBytes,
                                   std::uint32_t valueLength) noexcept;
 
-  // The key's value, for the current user on any host or in application scope. A key without a value is a
-  // success with an empty payload.
+  // Return the key's value, for the current user on any host or in application scope. A key without a value
+  // is a success with an empty payload.
   KernelReturn copyPreferenceValue(PortName port, char* domain, char* key,
                                    OutOfLinePayload* payload) noexcept;
   KernelReturn copyAppPreferenceValue(PortName port, char* domain, char* key,
                                       OutOfLinePayload* payload) noexcept;
 
-  // The file's dictionary. Any file that the helper can read will do: no policy of paths applies.
+  // Returns the file's dictionary. Accepts any file that the helper can read; no path policy applies.
   KernelReturn loadPlistFile(PortName port, char* path, OutOfLinePayload* payload) noexcept;
 
  private:

@@ -15,8 +15,8 @@ class RadioLogging {
   // `radio` must outlive this object.
   explicit RadioLogging(RadioManager& radio) noexcept : radio_(radio) {}
 
-  // Logging to file on for any `enable` but 0, off for 0. Always kern::success: whether the radio manager
-  // heard it is not known.
+  // Turns logging to a file off if `enable` is 0, else on. Always returns kern::success, because nobody knows
+  // whether the radio manager received it.
   KernelReturn enableRadioManagerLogs(PortName port, std::int32_t enable) noexcept;
 
  private:

@@ -20,8 +20,8 @@
 
 namespace brenvik {
 
-// These two routines work on after their reply. They need the server of the client's port, which their work
-// keeps alive.
+// These two routines continue to work after their reply. They need the server of the client's port, which
+// their work keeps alive.
 inline KernelReturn cellularHeartbeat(CellularHeartbeat& heartbeat, ServerContext& server,
                                       std::int32_t value) {
   heartbeat.setHeartbeat(server, value != 0);
@@ -42,16 +42,16 @@ struct AreaOf<KernelReturn (Owner::*)(Parameters...) noexcept> : std::type_ident
 template <class Owner, class... Parameters>
 struct AreaOf<KernelReturn (*)(Owner&, Parameters...)> : std::type_identity<Owner> {};
 
-// Areas by reference, each of which outlives this object. Main loop only.
+// References to the areas, each of which must outlive this object. Main loop only.
 template <class... Area>
 class AreasByReference {
  public:
   AreasByReference(PortServerRegistry& registry, Area&... areas) noexcept
       : areas_(areas...), registry_(registry) {}
 
-  // Calls the routine of its area with the arguments, then the place of the result if there is one. Before
-  // them it gets the port that the request arrived on, or the server of that port, if it takes one.
-  // kern::failure if it takes a server and the port has none.
+  // Calls the routine of its area. It passes the port that the request arrived on, or that port's server, if
+  // the routine takes one; then the arguments; then the place of the result, if there is one. Returns
+  // kern::failure if the routine takes a server and the port has none.
   template <auto routine, class... Arguments, class... Results>
   KernelReturn call(PortName port, const std::tuple<Arguments...>& arguments, Results*... results) {
     using Routine = decltype(routine);

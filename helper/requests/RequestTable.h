@@ -13,13 +13,13 @@ namespace brenvik {
 // The table of 27 request routines that is served on every client's port. A handler checks a request's form
 // against its row in interface/Routines.h, calls the routine of its area and builds the reply.
 //
-// The areas are made for the first request: whoever started the process waits for its check-in, which needs
-// none of them. Main loop only.
+// The areas are made at the first request, because the client that started the process is waiting for its
+// check-in, which needs none of them. Main loop only.
 template <class Areas = RequestAreas>
 class RequestTable final : public RoutineTable {
  public:
-  // `make` returns the areas, which outlive the table, or throws. While it throws, every request gets
-  // kern::resourceShortage, and the next one tries again.
+  // `make` returns the areas, which must outlive the table, or throws std::bad_alloc. Then the request gets
+  // kern::resourceShortage, and the next one calls `make` again.
   explicit RequestTable(std::function<Areas*()> make) : make_(std::move(make)) {}
 
   Handler find(std::int32_t id) const noexcept override {

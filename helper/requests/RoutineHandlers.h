@@ -15,7 +15,7 @@
 
 namespace brenvik {
 
-// The NDR record of a reply: our own, or the bytes that the source of the request left there.
+// The NDR record of a reply: our own, or the bytes that the routine source left in the reply.
 enum class ReplyNdr { ours, ofTheSource };
 
 template <class MessageStruct, auto areaRoutine, ReplyNdr replyNdr = ReplyNdr::ours>
@@ -25,8 +25,8 @@ struct Binding {
   static constexpr ReplyNdr ndr = replyNdr;
 };
 
-// What serves each row of interface/Routines.h, in the order of the rows: the struct of the request, whose
-// fields are the routine's arguments, and the routine of the area.
+// Binds each row of interface/Routines.h, in the order of the rows, to the struct of its request, whose
+// fields are the routine's arguments, and to the area's routine.
 using RoutineBindings =
     std::tuple<Binding<String256Request, &VoicemailOperations::setVoicemailToken>,
                Binding<TwoStrings256Request, &VoicemailOperations::setVoicemailTokenForKey>,
@@ -57,15 +57,16 @@ using RoutineBindings =
                Binding<TwoStrings64Request, &ChannelRemap::remapContactsChannel>>;
 static_assert(std::tuple_size_v<RoutineBindings> == kRequestRoutines.size());
 
-// The code that a request's form earns, before anything else is looked at. kern::success: it may be served.
+// Checks a request's form against its row. Returns kern::success if it may be served, else the code of the
+// error reply.
 KernelReturn checkForm(const RoutineFacts& facts, const Request& request) noexcept;
 
 // Completes the header and the fixed fields around the result that the routine wrote.
 void buildReply(ReplyForm form, ReplyNdr ndr, Reply& reply) noexcept;
 
 // A request's arguments, in the order of its fields. Texts point into the request, where the older routines
-// cut them in place; they have their field's size and need not be terminated. A region is its address and its
-// size in bytes; it is read in place and belongs to the transport.
+// terminate them in place; they have their field's size and need not be terminated. A region is passed as its
+// address and its size in bytes; it is read in place and the transport owns it.
 inline std::tuple<> argumentsOf(EmptyRequest&) noexcept { return {}; }
 inline auto argumentsOf(String256Request& m) noexcept { return std::tie(m.text); }
 inline auto argumentsOf(TwoStrings64Request& m) noexcept { return std::tie(m.first, m.second); }
@@ -73,7 +74,7 @@ inline auto argumentsOf(TwoStrings256Request& m) noexcept { return std::tie(m.fi
 inline auto argumentsOf(TwoStrings1024Request& m) noexcept { return std::tie(m.first, m.second); }
 inline auto argumentsOf(ThreeStrings256Request& m) noexcept { return std::tie(m.first, m.second, m.third); }
 inline auto argumentsOf(ThreeStrings1024Request& m) noexcept { return std::tie(m.first, m.second, m.third); }
-// A number of a packed struct cannot be referred to: its copy is an argument.
+// A reference cannot bind to a number in a packed struct, so the argument is a copy.
 inline auto argumentsOf(IntegerRequest& m) noexcept { return std::tuple(std::int32_t{m.value}); }
 inline auto argumentsOf(CoordinateRequest& m) noexcept {
   return std::tuple(double{m.latitude}, double{m.longitude});
@@ -88,8 +89,8 @@ inline auto argumentsOf(LabelsRequest& m) noexcept {
   return std::tuple_cat(regionOf(m.labels), regionOf(m.languages));
 }
 
-// Calls the routine of a row. A result is written straight into the reply, which starts as zeros; but an
-// out-of-line one only on success: what a failed routine left in its payload is not sent.
+// Calls the routine of a row. The routine writes its result straight into the reply, which starts as zeros.
+// An out-of-line result is copied only on success: the payload of a failed routine is not sent.
 template <std::size_t row, class Areas>
 KernelReturn callRoutine(Areas& areas, const Request& request, Reply& reply) {
   using Row = std::tuple_element_t<row, RoutineBindings>;

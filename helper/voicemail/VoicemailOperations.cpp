@@ -73,7 +73,7 @@ KernelReturn VoicemailOperations::copyVoicemailTokenForKey(PortName, char* key, 
 }
 
 KernelReturn VoicemailOperations::copyVoicemailToken(PortName, char* token) noexcept {
-  // What cannot be read is absent, and the store logs it.
+  // A token that cannot be read counts as absent, and the store logs it.
   token[0] = '\0';
   return guarded(kern::success, [&] {
     writeToken(store_.copyToken(), token);

@@ -17,14 +17,14 @@ namespace brenvik {
 // Keys and tokens are fields of kField bytes, UTF-8 with a NUL; the last byte of a field of the request is
 // overwritten with a NUL. The port is not used.
 //
-// The statuses: kern::success (0); kern::failure (5) when a text is not valid UTF-8, and then the store is
-// not called, or when memory does not suffice in a routine that takes a text. The routines without a text
-// always return kern::success. No status tells what the store could not do; the store logs that.
+// A routine with a text returns kern::failure (5) if the text is not valid UTF-8, without calling the store,
+// or if memory runs out. Otherwise, and for routines without a text, the status is kern::success (0). No
+// status tells whether the store succeeded; the store logs its failures.
 class VoicemailOperations {
  public:
   static constexpr std::size_t kField = 256;
 
-  // References must outlive the object. One object a process: it looks the subscription query up once.
+  // References must outlive the object. Make one object per process: it looks up the subscription query once.
   VoicemailOperations(VoicemailStore& store, VisualVoicemailLibrary& library)
       : store_(store), library_(library) {}
 
@@ -33,15 +33,15 @@ class VoicemailOperations {
   KernelReturn setVoicemailTokenForKey(PortName port, char* key, char* token) noexcept;
   // Removes the general token.
   KernelReturn clearVoicemailToken(PortName port) noexcept;
-  // Removes the general token, then the tokens of all keys, the latter also when the former failed.
+  // Removes the general token, then, even if that failed, the tokens of all keys.
   KernelReturn resetVoicemailStore(PortName port) noexcept;
 
-  // Write the token and a NUL into the reply's field of kField bytes; an empty text when there is no token,
-  // it cannot be read, it is not valid UTF-8 or it does not fit. The field is left alone with kern::failure.
+  // Write the token and a NUL into the reply's field of kField bytes; an empty text if there is no token, or
+  // it cannot be read, is not valid UTF-8 or does not fit. With kern::failure the field is left alone.
   KernelReturn copyVoicemailTokenForKey(PortName port, char* key, char* token) noexcept;
   KernelReturn copyVoicemailToken(PortName port, char* token) noexcept;
 
-  // *subscribed: 1 or 0; 0 as well when the system has no visual voicemail.
+  // Sets *subscribed to 1 or 0; 0 also if the system has no visual voicemail.
   KernelReturn isVoicemailServiceSubscribed(PortName port, std::uint8_t* subscribed) noexcept;
 
  private:

@@ -10,13 +10,15 @@
 #include <string_view>
 #include <vector>
 
-// What the status socket sends: one datagram of lines "key=value", the same on both sides.
+// The datagram that the status socket sends: lines "key=value". Helper and reader share this code. Writing
+// and reading throw std::bad_alloc.
 namespace brenvik {
 
-// The status socket is the service socket's path and this.
+// The status socket's path is the service socket's path plus this suffix.
 inline constexpr std::string_view kStatusSocketSuffix = ".status";
 
-// A reader takes nothing larger. Names and words in it are short, so a real one stays far below.
+// The largest datagram that a reader accepts, in bytes. Names and words in it are short, so a real one is far
+// smaller.
 inline constexpr std::size_t kLargestStatus = 16384;
 
 // Something that happened, and how long ago.
@@ -27,7 +29,7 @@ struct StatusEvent {
 };
 
 struct StatusReport {
-  // Reasons for busy tokens, as they are sent; see busyReasons() for people's words.
+  // Reasons for busy tokens, as they are sent; busyReasons() has the words for people.
   static constexpr const char* kDatabaseCheck = "database-check";
   static constexpr const char* kHeartbeat = "heartbeat";
 
@@ -55,15 +57,15 @@ struct StatusReport {
 
   std::string version;
   std::uint64_t process = 0;
-  std::string executable;   // absolute path; empty: not known
-  bool isReplaced = false;  // another file stands there now
+  std::string executable;   // absolute path; empty: unknown
+  bool isReplaced = false;  // another file has that path now
   std::string socket;       // of the service
   std::chrono::milliseconds running{0};
   std::uint64_t clients = 0;
   std::uint64_t busyTokens = 0;
   std::vector<Busy> busy;
   bool isKeptByBaseband = false;                      // at the last tick of the idle timer
-  std::optional<std::chrono::milliseconds> leavesIn;  // the next tick; none: nothing is counted down
+  std::optional<std::chrono::milliseconds> leavesIn;  // time to the next tick; none: no countdown runs
   bool isHeartbeatOn = false;
   Traffic heartbeatSent;
   Traffic heartbeatReceived;
@@ -74,15 +76,15 @@ struct StatusReport {
   bool operator==(const StatusReport&) const = default;
 };
 
-// The datagram. What would break a line is left out of its value; a malformed word becomes "unknown".
+// Writes the datagram. Characters that would break a line are left out; a malformed word becomes "unknown".
 std::string writeStatus(const StatusReport& report);
 
-// Nothing when the text is no such datagram. Keys that are not known are passed over, so that a newer helper
-// is understood.
+// Reads the datagram; returns nothing if it is malformed. Unknown keys are ignored, so that a newer helper is
+// understood.
 std::optional<StatusReport> readStatus(std::string_view text);
 
-// What keeps the helper from leaving, in words: "2 clients", "a database check", "the heartbeat". Empty:
-// nothing does.
+// The reasons why the helper does not leave, in words: "2 clients", "a database check", "the heartbeat".
+// Empty if there are none.
 std::vector<std::string> busyReasons(const StatusReport& report);
 
 }  // namespace brenvik

@@ -15,15 +15,15 @@ struct AccountIds {
   bool operator==(const AccountIds&) const = default;
 };
 
-// The accounts the system knows. Any thread; a call may wait for the service that keeps the accounts.
-// Throws std::bad_alloc when this process lacks the memory or the descriptors to find out: that is no answer.
+// The accounts the system knows. Any thread; a call may block on the service that keeps the accounts.
+// Throws std::bad_alloc when this process lacks the memory or the descriptors to find out.
 class AccountDirectory {
  public:
   virtual ~AccountDirectory() = default;
-  // Nothing when there is no such account, or it could not be looked up.
+  // Returns nothing if there is no such account, or if it could not be looked up.
   virtual std::optional<AccountIds> idsOf(const char* name) = 0;
-  // The path of the account's home directory, as the system reports it, whether it exists or not. Nothing
-  // when there is no such account or it has none.
+  // Returns the path of the account's home directory as the system reports it; the directory may not exist.
+  // Returns nothing if there is no such account, or if it has no home directory.
   virtual std::optional<std::string> homeDirectoryOf(const char* name) = 0;
 };
 

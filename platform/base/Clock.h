@@ -6,8 +6,8 @@
 
 namespace brenvik {
 
-// The time since the system started, sleep included: the clock of the run loop's timers. It is never set. Any
-// thread; no system call.
+// The time since the system started, sleep included. The run loop's timers use this clock; nobody can set it.
+// Any thread; makes no system call.
 std::chrono::nanoseconds timeSinceBoot() noexcept;
 
 }  // namespace brenvik

@@ -6,7 +6,7 @@
 
 namespace brenvik {
 
-// An errno in words, for log lines. Any thread.
+// Describes an errno in words, for log lines. Any thread.
 inline const char* describeError(int error) noexcept {
   const char* const text = ::strerrordesc_np(error);
   return text != nullptr ? text : "unknown error";

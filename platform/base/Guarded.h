@@ -6,8 +6,8 @@
 
 namespace brenvik {
 
-// For functions whose status says that memory did not suffice: returns what `work` returns, or `onFailure`
-// when it throws std::bad_alloc, or std::system_error where the system lacks a thread or a lock.
+// For functions that report "out of memory" as a status. Returns the result of `work`, or `onFailure` if
+// `work` throws std::bad_alloc, or std::system_error because the system has no thread or lock to give.
 template <typename Result, typename Work>
 Result guarded(Result onFailure, Work&& work) noexcept {
   try {

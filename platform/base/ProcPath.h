@@ -11,13 +11,13 @@
 
 namespace brenvik {
 
-// The path of a file of /proc/PID. Each check-in needs two of them; made by snprintf(3), the first one costs
-// five page faults.
+// The path of a file in /proc/PID. Each check-in needs two of them, and the first snprintf(3) of a process
+// costs five page faults, so the path is put together by hand.
 class ProcPath {
  public:
   static constexpr std::size_t kLongestName = 15;
 
-  // `name` has at most kLongestName characters; a longer one is cut.
+  // A `name` of more than kLongestName characters is cut.
   ProcPath(pid_t pid, std::string_view name) noexcept {
     constexpr std::string_view kFolder = "/proc/";
     char* at = text_.data() + kFolder.copy(text_.data(), kFolder.size());

@@ -19,20 +19,20 @@ struct ProcessFacts {
   std::uint32_t startTime = 0;  // field 22, clock ticks since boot, low 32 bits
 };
 
-// Nothing when the text is not of that form.
+// Returns nothing if the text does not have that form.
 std::optional<ProcessFacts> parseProcessStat(std::string_view text) noexcept;
 
-// Nothing when there is no such process. Any thread; allocates nothing.
+// Returns nothing if there is no such process. Any thread; allocates nothing.
 std::optional<ProcessFacts> processFacts(pid_t pid) noexcept;
 std::optional<std::uint32_t> processStartTime(pid_t pid) noexcept;
 
 // The program file that this process runs. Any thread.
 struct ProgramFacts {
-  std::string path;         // its path when the process started; empty: not known
-  bool isReplaced = false;  // the path is another file now, or none
+  std::string path;         // its path when the process started; empty: unknown
+  bool isReplaced = false;  // the path now names another file, or no file
 };
 ProgramFacts programFacts();
-// The same for a link like /proc/self/exe.
+// Reads them from a link like /proc/self/exe. Throws std::bad_alloc.
 ProgramFacts programFactsOf(const char* link);
 
 }  // namespace brenvik

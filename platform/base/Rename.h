@@ -4,8 +4,9 @@
 
 namespace brenvik {
 
-// Renames within a folder and replaces nothing: -1 with errno EEXIST when the name is taken. Not every file
-// system can do that in one step; on the others the check comes first, so the caller keeps other writers out.
+// Renames a file within a folder without replacing another. Returns 0, or -1 and sets errno, to EEXIST if the
+// name is taken. Some file systems cannot do this in one step; there, the check comes first, so the caller
+// must keep other writers out.
 int renameToFreeName(int folder, const char* from, const char* to) noexcept;
 
 }  // namespace brenvik

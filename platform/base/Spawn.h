@@ -7,9 +7,9 @@
 
 namespace brenvik {
 
-// How a child process is started, by posix_spawn(3): with the signals' default actions, none of them blocked,
-// and none of this process's descriptors but 0 to 2. Settings that the system refuses show as the result of
-// start(). One thread.
+// Starts a child process with posix_spawn(3). The child has the default action for every signal, no blocked
+// signals, and no descriptors of this process but 0 to 2. If the system refuses a setting, start() returns
+// the error. Each object belongs to one thread.
 class Spawn {
  public:
   Spawn() noexcept;
@@ -17,15 +17,15 @@ class Spawn {
   Spawn(const Spawn&) = delete;
   Spawn& operator=(const Spawn&) = delete;
 
-  // The child's descriptor `as` is this one, or /dev/null for writing.
+  // Makes the child's descriptor `as` a copy of this one, or /dev/null opened for writing.
   void give(int descriptor, int as) noexcept;
   void giveNothing(int as) noexcept;
   void enterFolder(const char* path) noexcept;
-  // Without the controlling terminal of this process.
+  // Starts the child in a session of its own, without this process's controlling terminal.
   void startSession() noexcept { flags_ |= POSIX_SPAWN_SETSID; }
 
-  // Starts the program, whose arguments and environment each end with a null pointer. Returns 0 or an errno;
-  // *pid is set on success only. The caller reaps the child. To be called once.
+  // Starts the program. `arguments` and `environment` each end with a null pointer. Returns 0 or an errno;
+  // *pid is set only on success. The caller must reap the child. Call it once.
   int start(const char* program, char* const arguments[], char* const environment[], pid_t* pid) noexcept;
 
  private:

@@ -23,10 +23,10 @@ class [[nodiscard]] UniqueFd {
   UniqueFd& operator=(const UniqueFd&) = delete;
   ~UniqueFd() { reset(); }
 
-  // The descriptor, still owned by this object; -1 when there is none.
+  // Returns the descriptor, which this object still owns; -1 if it has none.
   int get() const noexcept { return fd_; }
   bool isValid() const noexcept { return fd_ >= 0; }
-  // Gives the descriptor away; the caller closes it.
+  // Gives up the descriptor; the caller must close it.
   [[nodiscard]] int release() noexcept { return std::exchange(fd_, -1); }
   void reset(int next = -1) noexcept {
     if (const int old = std::exchange(fd_, next); old >= 0) ::close(old);

@@ -11,8 +11,8 @@ namespace brenvik {
 // A NUL byte is well-formed. Any thread; allocates nothing.
 bool isValidUtf8(std::string_view bytes) noexcept;
 
-// The length in bytes, 1 to 4, of the well-formed character that the bytes begin with; 0 when they begin with
-// none. Any thread; allocates nothing.
+// Returns the length in bytes, 1 to 4, of the first character; 0 if it is not well-formed, or if there are no
+// bytes. Any thread; allocates nothing.
 std::size_t utf8CharacterLength(std::string_view bytes) noexcept;
 
 // The text of a fixed-size message field: everything before its first NUL, or the whole field.

@@ -11,17 +11,17 @@
 
 namespace brenvik {
 
-// Write all the bytes, in as many calls as it takes. Each returns 0, or the errno of the call that failed;
-// some of the bytes may have been written then. An interrupted call is repeated. Any thread; they allocate
-// nothing. A descriptor that does not block answers EAGAIN when it is full.
+// These functions write all the bytes, in as many system calls as that takes, and repeat interrupted calls.
+// They return 0 or the errno of the call that failed; some of the bytes may have been written by then. On a
+// non-blocking descriptor that is full, they return EAGAIN. Any thread; they allocate nothing.
 
-// At the file's position.
+// Writes at the file's position.
 int writeAll(int file, std::string_view bytes) noexcept;
 int writeAll(int file, std::span<const std::byte> bytes) noexcept;
-// One piece after the other; `pieces` is used up.
+// Writes the pieces in order, at the file's position; changes `pieces`.
 int writeAll(int file, std::span<iovec> pieces) noexcept;
 
-// At `offset`, in bytes; the file's position stays.
+// Writes at `offset`, in bytes; the file's position stays.
 int writeAllAt(int file, off_t offset, std::string_view bytes) noexcept;
 
 }  // namespace brenvik

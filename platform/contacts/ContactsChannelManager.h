@@ -15,19 +15,18 @@ class ContactsChannelManager {
  public:
   virtual ~ContactsChannelManager() = default;
 
-  // Moves every reference from one channel identifier to another, all of them or none. True when none is left
-  // behind, also when there was none. On failure *error is a description in English, else it is left alone.
-  // A text that is not valid UTF-8 is a failure. May take seconds while another program writes.
+  // Moves every reference from one channel identifier to another, all of them or none. Returns true if they
+  // were moved or there were none. On failure *error describes the cause in English; on success it is left
+  // alone. A text that is not valid UTF-8 is a failure. May take seconds while another program writes.
   virtual bool remapChannelIdentifier(std::string_view from, std::string_view to,
                                       std::optional<std::string>* error) noexcept = 0;
 };
 
-// Where managers come from.
+// Makes managers. Main loop only.
 class ContactsService {
  public:
   virtual ~ContactsService() = default;
-  // A new manager, or null when the contacts cannot be reached. Throws std::bad_alloc when memory did not
-  // suffice to find out.
+  // Returns a new manager, or null if the contacts cannot be reached. Throws std::bad_alloc.
   virtual std::unique_ptr<ContactsChannelManager> makeChannelManager() = 0;
 };
 

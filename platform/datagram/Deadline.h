@@ -8,7 +8,7 @@
 
 namespace brenvik {
 
-// A point in time after which nothing waits any longer, on CLOCK_MONOTONIC.
+// The point in time, on CLOCK_MONOTONIC, at which a wait ends.
 class Deadline {
  public:
   using Clock = std::chrono::steady_clock;

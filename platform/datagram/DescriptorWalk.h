@@ -11,11 +11,11 @@
 
 namespace brenvik {
 
-// What a datagram's bytes alone say about the rights and regions it carries; nothing is received, mapped or
-// changed. Every length and offset in it comes from the peer.
+// The rights and regions that a datagram claims to carry, read from its bytes alone; nothing is received,
+// mapped or changed. Every length and offset in the datagram comes from the peer.
 struct DescriptorWalk {
-  // The message's size as its receiver sees it: the datagram's length, or with in-line regions the size the
-  // sender wrote. Bytes.
+  // The message's size in bytes as its receiver sees it: the datagram's length, or, with in-line regions, the
+  // size that the sender wrote.
   std::uint32_t messageSize = 0;
   // How many descriptors the control data must carry: ports, and regions that travel as a memfd.
   std::uint32_t rights = 0;

@@ -11,39 +11,39 @@
 
 #include "platform/base/UniqueFd.h"
 
-// AF_UNIX sockets of type SOCK_SEQPACKET: what channels and named services are made of. Nothing here throws
+// AF_UNIX sockets of type SOCK_SEQPACKET, on which channels and named services are built. Nothing here throws
 // or allocates. Any thread.
 namespace brenvik {
 
-// The address of a socket file; nothing when the path is empty or too long for one.
+// Returns the address of a socket file; nothing if the path is empty or too long for an address.
 std::optional<sockaddr_un> socketAddress(std::string_view path) noexcept;
 std::optional<sockaddr_un> socketAddress(std::string_view directory, std::string_view name) noexcept;
 
 enum class Blocking : std::uint8_t { no, yes };
 
-// A socket without an address, close-on-exec. Invalid with errno set when the kernel refuses.
+// Makes a socket without an address, close-on-exec. Returns an invalid descriptor and sets errno on failure.
 UniqueFd makeSocket(Blocking blocking) noexcept;
-// Two connected sockets, blocking and close-on-exec. Returns 0 or an errno; then both stay as they are.
+// Makes two connected sockets, blocking and close-on-exec. Returns 0, or an errno and leaves both as they
+// are.
 int makeSocketPair(UniqueFd* one, UniqueFd* other) noexcept;
-// connect(2) and bind(2): 0, or -1 with errno set.
+// connect(2) and bind(2). Return 0, or -1 and set errno.
 int connectSocket(int socket, const sockaddr_un& address) noexcept;
 int bindSocket(int socket, const sockaddr_un& address) noexcept;
 
-// Whether a descriptor is such a socket, connected or not. Two system calls.
+// Whether a descriptor is such a socket, connected or not. Makes two system calls.
 bool isLocalSocket(int descriptor) noexcept;
-// The same, and whether it listens as well. Three system calls.
+// The same, and whether it listens or not. Makes three system calls.
 enum class Listening : std::uint8_t { no, yes };
 bool isLocalSocket(int descriptor, Listening listening) noexcept;
 
-// Who made the connection (SO_PEERCRED); nothing when the kernel does not say.
+// The credentials of the process that made the connection (SO_PEERCRED); nothing if the kernel has none.
 std::optional<ucred> peerOf(int connection) noexcept;
 
-// Has each datagram come with its sender's credentials from now on. False with errno set when the kernel
-// refuses.
+// From now on, each datagram comes with its sender's credentials. Returns false and sets errno on failure.
 bool askForCredentials(int socket) noexcept;
 
-// Whether no message lies in a socket that can receive none any more, so that closing it drops nothing. Asks
-// for credentials on the way: only so an empty message is told from the end of the channel.
+// For a socket that can receive no more: whether it holds no unread message, so that closing it drops
+// nothing. It turns credentials on, because only they tell an empty message from the end of the channel.
 bool isDrained(int socket) noexcept;
 
 }  // namespace brenvik

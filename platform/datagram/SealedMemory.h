@@ -8,30 +8,31 @@
 
 #include "platform/base/UniqueFd.h"
 
-// Memory without a name (memfd_create(2)) that carries to another process what is too long for a datagram.
-// The sender seals it against change; the receiver looks for the seals before it believes the length. Nothing
-// here throws or allocates. Any thread.
+// Anonymous memory (memfd_create(2)) for data that is too long for a datagram. The sender seals it against
+// change; the receiver checks the seals before it trusts the length. Nothing here throws or allocates. Any
+// thread.
 namespace brenvik {
 
-// Empty memory, close-on-exec, which is written like a file and can be sealed later. Invalid with errno set
-// when memory or descriptors are lacking. `name` is for people who look at /proc.
+// Makes empty memory, close-on-exec, which is written like a file and can be sealed later. Returns an invalid
+// descriptor and sets errno if memory or descriptors run out. `name` appears in /proc.
 UniqueFd makeSealableMemory(const char* name) noexcept;
 
-// Seals it against shrinking, growing, writing and further seals. Refused while it is mapped for writing.
+// Seals it against shrinking, growing, writing and further seals. Returns false on failure: it fails while
+// the memory is mapped for writing.
 bool sealMemory(int memory) noexcept;
 
-// Both, with these bytes in it.
+// Makes memory with these bytes and seals it. Returns an invalid descriptor and sets errno on failure.
 UniqueFd makeSealedMemory(const char* name, std::span<const std::byte> bytes) noexcept;
 
-// The size of memory that is sealed against shrinking, growing and writing, in bytes; -1 when the descriptor
-// is anything else, memory of huge pages included, which is mapped in other units.
+// Returns the size in bytes of memory that is sealed against shrinking, growing and writing; -1 for any other
+// descriptor. Memory of huge pages counts as other, because it is mapped in larger units.
 std::int64_t sizeOfSealedMemory(int memory) noexcept;
 
-// Maps memory that sizeOfSealedMemory() has looked at, for reading. Null with errno set when the kernel
-// refuses. The caller unmaps it.
+// Maps memory that sizeOfSealedMemory() has checked, for reading. Returns null and sets errno on failure. The
+// caller must unmap it.
 void* mapSealedMemory(int memory, std::size_t length) noexcept;
 
-// Sealed memory that another process has written, mapped for reading. Unmapped by the destructor.
+// Sealed memory that another process has written, mapped for reading. The destructor unmaps it.
 class SealedMemory {
  public:
   SealedMemory() = default;
@@ -41,8 +42,8 @@ class SealedMemory {
   SealedMemory& operator=(const SealedMemory&) = delete;
   ~SealedMemory();
 
-  // Returns 0, EBADMSG for what is not sealed or not exactly `length` bytes long, or the errno of mmap(2); on
-  // failure nothing is mapped. The descriptor stays the caller's and is not needed any more afterwards.
+  // Returns 0; EBADMSG if the memory is not sealed or not exactly `length` bytes long; or the errno of
+  // mmap(2). On failure nothing is mapped. The caller still owns the descriptor and may close it afterwards.
   static int map(int memory, std::size_t length, SealedMemory* mapped) noexcept;
 
   std::span<const std::byte> bytes() const noexcept { return {address_, length_}; }

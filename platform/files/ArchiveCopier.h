@@ -10,15 +10,15 @@
 
 namespace brenvik {
 
-// What the handler of a file error may answer.
+// The answers of a file error handler.
 namespace archive_answer {
 inline constexpr int skipFile = 1;  // go on without this entry
-inline constexpr int stopCopy = 2;  // give the whole copy up
+inline constexpr int stopCopy = 2;  // give up the whole copy
 }  // namespace archive_answer
 
 // One entry of an archive that cannot be unpacked: where it would have gone and why not.
 struct ArchiveFileError {
-  std::string path;  // as the archive has it; may be any bytes
+  std::string path;  // as the archive spells it; any bytes
   int code;          // errno value
 };
 
@@ -28,17 +28,20 @@ class ArchiveCopier {
  public:
   virtual ~ArchiveCopier() = default;
 
-  // An entry cannot be unpacked: it would leave the destination, is of a refused kind, or the like. The
-  // answer is one of archive_answer; any other counts as stopCopy. Without a handler: stopCopy.
+  // The handler runs when an entry cannot be unpacked, for example because it would leave the destination or
+  // is of a refused kind. It returns one of archive_answer; any other value counts as stopCopy, and so does
+  // the lack of a handler.
   virtual void setFileErrorHandler(std::function<int(const ArchiveFileError&)> handler) = 0;
-  // The copy as a whole fails: no archive, a damaged one, no room, no time, the reader died.
+  // The handler runs with an errno value when the whole copy fails: the archive is missing or damaged, the
+  // disk is full, the time is over, or the reader died.
   virtual void setFatalErrorHandler(std::function<void(int code)> handler) = 0;
 
   // Options, a dictionary of booleans: "extractPKZip" (the archive is a zip archive; required),
   // "copyExtendedAttributes", "copyResources" (resource data, which Linux keeps as "._name" beside its file).
-  // 0 when everything was unpacked that no handler skipped, else an errno value. The destination and the
-  // directories above it are made when missing. Nothing shows at the destination before the archive was read
-  // to its end; a file that was there then gives way in one step. On the disk when it succeeds.
+  // Returns 0 if every entry that no handler skipped was unpacked, else an errno value. Makes the destination
+  // and the directories above it if they are missing. Nothing appears at the destination before the archive
+  // has been read to its end; existing files are then replaced in one step each. On success everything is on
+  // the disk.
   virtual int copy(const std::string& archive, const std::string& destination,
                    const PropertyList& options) noexcept = 0;
 };

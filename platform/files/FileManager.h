@@ -11,7 +11,7 @@
 
 namespace brenvik {
 
-// How a file operation ended. A failure carries an errno value, or 0 when the platform did not say why.
+// The result of a file operation. A failure carries an errno value, or 0 if the platform did not say why.
 class [[nodiscard]] FileOutcome {
  public:
   static constexpr FileOutcome success() { return FileOutcome(true, 0); }
@@ -19,7 +19,7 @@ class [[nodiscard]] FileOutcome {
   static constexpr FileOutcome failureWithoutCode() { return FileOutcome(false, 0); }
 
   constexpr bool succeeded() const { return succeeded_; }
-  // 0 on success; on failure its code, or `otherwise` when there is none.
+  // Returns 0 on success; on failure its code, or `otherwise` if it has none.
   constexpr int codeOr(int otherwise) const { return succeeded_ ? 0 : code_ != 0 ? code_ : otherwise; }
   constexpr bool operator==(const FileOutcome&) const = default;
 
@@ -30,8 +30,8 @@ class [[nodiscard]] FileOutcome {
 };
 
 enum class IfPresent {
-  fail,                // EEXIST when anything, a dangling link included, stands at the destination
-  replaceNonDirectory  // what stands there gives way in one step, unless it is a directory (EEXIST)
+  fail,                // EEXIST if the destination exists, even as a dangling link
+  replaceNonDirectory  // replaces the item there in one step, unless it is a directory (EEXIST)
 };
 
 enum class Intermediates { mustExist, create };
@@ -47,61 +47,61 @@ struct DirectoryAttributes {
   std::string_view groupName;
 };
 
-// The owner of a link is its own, never that of what it points to. Other accounts' links do not become root's
-// or this account's; such a change counts as done.
+// Changing the owner of a link changes the link itself, never its target. A link of another account is never
+// given to root or to this account; such a change is skipped and counts as success.
 struct ItemAttributes {
   std::optional<mode_t> mode;  // links are passed over
   std::optional<uid_t> uid;
   std::optional<gid_t> gid;
 };
 
-// What the item that a copy makes is given before it has its name, so that nothing else can be given away in
-// its place. An item that cannot have the attributes is shown without them.
+// Attributes that a copy gets before it has its name, so that nobody can put another item in its place. If
+// the attributes cannot be set, the item appears without them.
 struct Gift {
   ItemAttributes attributes;
-  // Success if the item stands at its place and has the attributes.
+  // Success if the item is at its place and has the attributes.
   FileOutcome outcome = FileOutcome::failureWithoutCode();
 };
 
 enum class ItemKinds { all, noFiles };
 
-// Is told of the items below a directory.
+// Visits the items below a directory.
 class ItemVisitor {
  public:
   enum class Next { descend, skipBelow };
   virtual ~ItemVisitor() = default;
   // `subpath`: relative to the directory enumerated, no leading slash. `isDirectory`: of the item itself,
-  // links not followed. The answer counts for directories only. Must not throw.
+  // links not followed. The result matters for directories only. Must not throw.
   virtual Next visit(const std::string& subpath, bool isDirectory) noexcept = 0;
 };
 
-// The platform's file manager: whole items, with data, modes, owners (as far as permitted), times, links and
-// extended attributes. Paths are NUL-terminated bytes. A link that is itself the item is copied, moved or
-// removed as a link, and nothing is ever written through one. On the way to what is made, changed or removed,
-// a link is followed only when nobody but root and this account can have put it there; else the operation
-// fails as if the directory were missing. On the way to what is read or copied, root's and this account's own
-// links are followed wherever they stand, unless ".." is in their target.
+// The platform's file manager. It handles whole items, with data, modes, owners (as far as permitted), times,
+// links and extended attributes. Paths are NUL-terminated bytes. An item that is a link is copied, moved or
+// removed as a link, and nothing is ever written through a link. On the path to an item that is made, changed
+// or removed, a link is followed only if nobody but root and this account can have put it there; otherwise
+// the operation fails as if the directory were missing. On the path to an item that is read or copied, links
+// of root and this account are followed in any directory, unless their target contains "..".
 //
-// A copy or a move shows at its destination whole or not at all, even when the process is killed. What a
-// killed process leaves is a hidden ".brenvik-" item beside the destination; the next operation in that
-// folder removes it. Items of such names that somebody else has made are left alone.
+// A copy or a move appears at its destination whole or not at all, even if the process is killed. A killed
+// process leaves a hidden ".brenvik-" item beside the destination; the next operation in that folder removes
+// it. Items with such names that another account has made are left alone.
 //
-// One thread at a time. Blocks on the disk and nothing else. Throws nothing: memory exhaustion is ENOMEM.
+// One thread at a time. Blocks only on the disk. Throws nothing: a lack of memory is ENOMEM.
 class FileManager {
  public:
   virtual ~FileManager() = default;
 
-  // Temporaries of the operations may live from openScope to closeScope; scopes nest.
+  // Between openScope and closeScope, operations may keep temporary objects; scopes nest.
   virtual void openScope() noexcept = 0;
   virtual void closeScope() noexcept = 0;
 
-  // Whether anything is at the path, a link that is itself the item followed; then, if asked, whether it is a
-  // directory.
+  // Whether an item is at the path; follows a link there. If it is and `isDirectory` is not null, tells
+  // whether it is a directory.
   virtual bool itemExists(const std::string& path, bool* isDirectory) noexcept = 0;
 
-  // Fail with EINVAL when a directory would come to stand inside itself. moveItem is one rename inside a file
-  // system; across two it copies, waits until the copy is on the disk, then removes the source. It ends with
-  // the item whole at one of the two places: where something in the source cannot be removed (EBUSY: a mount;
+  // Both fail with EINVAL if a directory would end up inside itself. Within a file system, moveItem is one
+  // rename; across two it copies, waits until the copy is on the disk, then removes the source. In the end
+  // the item is whole at one of the two places: if something in the source cannot be removed (EBUSY: a mount;
   // EPERM: an immutable file; EROFS ...), it stays where it was. A source that ends in "." or ".." is EBUSY.
   // `gift` may be null.
   virtual FileOutcome copyItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
@@ -109,50 +109,50 @@ class FileManager {
                                Gift* gift = nullptr) noexcept = 0;
   virtual FileOutcome moveItem(const std::string& source, const std::string& destination, IfPresent ifPresent,
                                Durability durability = Durability::eventual) noexcept = 0;
-  // With everything below it.
+  // Removes the item and everything below it.
   virtual FileOutcome removeItem(const std::string& path) noexcept = 0;
-  // A file, a link or an empty directory; on the disk when it succeeds.
+  // Removes a file, a link or an empty directory. On success, the removal is on the disk.
   virtual FileOutcome removeEntry(const std::string& path) noexcept = 0;
 
-  // A symbolic link at the path, on the disk when it succeeds. What stands there gives way in one step, a
-  // directory only if it is empty. When the link cannot be made, what was there stays.
+  // Makes a symbolic link at the path; on success it is on the disk. It replaces the item there in one step;
+  // a directory only if it is empty. If the link cannot be made, the old item stays.
   virtual FileOutcome placeLink(const std::string& path, const std::string& target) noexcept = 0;
 
   // Waits until the item, its attributes, everything below it and its name are on the disk.
   virtual FileOutcome syncItem(const std::string& path) noexcept = 0;
 
-  // With `create`, a directory that is there already is a success, and the attributes go to those made. What
-  // is made is on the disk when it succeeds.
+  // With `create`, a directory that already exists is a success, and only the directories made get the
+  // attributes. On success they are on the disk.
   virtual FileOutcome createDirectory(const std::string& path, const DirectoryAttributes& attributes,
                                       Intermediates intermediates) noexcept = 0;
 
   // Appends the names of the entries, without "." and "..", in no particular order.
   virtual FileOutcome listDirectory(const std::string& path, std::vector<std::string>* names) noexcept = 0;
 
-  // Calls the visitor for everything below the directory, each directory before what is in it. The names of a
-  // directory are read when it is descended into; the visitor may change the tree meanwhile. Links below are
-  // not followed, and a link at the path itself counts as one on the way. The failure reported is the first
-  // that kept a directory from being read.
+  // Calls the visitor for everything below the directory, each directory before its contents. The names in a
+  // directory are read when it is entered; the visitor may change the tree meanwhile. Links below are not
+  // followed; a link at the path itself counts as one on the path to an item. Returns the first failure to
+  // read a directory.
   virtual FileOutcome enumerateBelow(const std::string& path, ItemVisitor& visitor) noexcept = 0;
 
-  // Changes the very item that it has looked at. With `noFiles`, a regular file is EINVAL. A file with
-  // further names (hard links), which may stand anywhere, is EPERM unless it belongs to the owner of the
-  // directory it was found in and nobody else may write there.
+  // Changes exactly the item that it has checked, even if the path is replaced meanwhile. With `noFiles`, a
+  // regular file is EINVAL. A file with several names (hard links) is EPERM, because the others may be
+  // anywhere, unless the file belongs to the owner of its directory and nobody else may write there.
   virtual FileOutcome setAttributes(const std::string& path, const ItemAttributes& attributes,
                                     ItemKinds kinds = ItemKinds::all) noexcept = 0;
-  // The same for everything below a directory, then for the item at the path. Goes on past what cannot be
-  // changed. Reports the failure of the item at the path, else the last one below it.
+  // The same for everything below a directory, then for the item at the path. Continues past items that
+  // cannot be changed. Returns the failure of the item at the path, else the last failure below it.
   virtual FileOutcome setAttributesOfTree(const std::string& path,
                                           const ItemAttributes& attributes) noexcept = 0;
 
-  // The bytes of a regular file, at most `limit` of them; nothing when it is missing, larger, unreadable or
+  // Returns the bytes of a regular file; nothing if it is missing, longer than `limit` bytes, unreadable or
   // not a regular file. Never waits for a writer.
   virtual std::optional<std::string> readFile(const std::string& path, std::size_t limit) noexcept = 0;
 
-  // The old content or the new, durably, never a part. A file that is there passes its mode and owner on; a
-  // link that is there is replaced, not followed.
+  // Writes a file so that it has the old content or the new, durably, never a part. The new file keeps the
+  // mode and owner of the old one; a link is replaced, not followed. Returns false on failure.
   virtual bool writeFileAtomically(const std::string& path, std::string_view bytes) noexcept = 0;
-  // Truncates and writes in place, like a stream that was opened on the path. Refuses a link.
+  // Truncates the file and writes in place, or makes it. Refuses a link. Returns false on failure.
   virtual bool writeFile(const std::string& path, std::string_view bytes) noexcept = 0;
 };
 

@@ -13,10 +13,10 @@
 namespace brenvik {
 
 struct AuditToken;
-class GeoTraits;           // a caller's wishes for an answer; not used here
-class GeoNetworkActivity;  // a caller's activity that traffic is accounted to; not used here
+class GeoTraits;           // the caller's preferences for an answer; not used here
+class GeoNetworkActivity;  // the caller's activity that traffic is attributed to; not used here
 
-// Degrees, north and east positive. Any numbers may stand here; the service judges them.
+// Degrees, north and east positive. Any numbers are possible; the service checks them.
 struct Coordinate {
   double latitude = 0;
   double longitude = 0;
@@ -37,7 +37,7 @@ struct GeoAddress {
   std::optional<StructuredAddress> structuredAddress;
 };
 
-// A place an answer speaks of.
+// A place in an answer.
 struct MapItem {
   bool valid = true;
   std::optional<GeoAddress> address;
@@ -49,20 +49,21 @@ struct GeoError {
 };
 
 struct GeoIpResult {
-  std::string ipAddress;  // as text; empty when there is none
+  std::string ipAddress;  // as text; empty: none
 };
 
-// Exactly one of answer and error is given; an answer without items means that nothing is known of the place.
+// Exactly one of answer and error is given; an answer without items means that nothing is known about the
+// place.
 using ReverseGeocodeHandler =
     std::function<void(const std::optional<MapItems>&, const std::optional<GeoError>&)>;
 using GeoIpHandler = std::function<void(const std::optional<GeoIpResult>&, const std::optional<GeoError>&)>;
 
-// A question that has been put together and not yet asked. It may be destroyed as soon as it is submitted.
+// A question that is prepared but not yet asked. It may be destroyed as soon as it is submitted.
 class ReverseGeocodeTicket {
  public:
   virtual ~ReverseGeocodeTicket() = default;
-  // Asks. The handler runs once, later, as a task of `handlerQueue`: never from within this call, and not at
-  // all when the queue is gone by then. Any thread; does not wait.
+  // Asks. The handler runs once, later, as a task of `handlerQueue`: never within this call, and not at all
+  // if the queue is gone by then. Any thread; does not wait.
   virtual void submit(ReverseGeocodeHandler handler, const GeoNetworkActivity* networkActivity,
                       const std::shared_ptr<WorkQueue>& handlerQueue) = 0;
 };
@@ -76,8 +77,8 @@ class GeoIpTicket {
                       const std::shared_ptr<WorkQueue>& handlerQueue) = 0;
 };
 
-// Makes the tickets of look-ups. Any thread. It must outlive its tickets; answers that are under way when
-// it is destroyed are dropped.
+// Makes tickets for look-ups. Any thread. It must outlive its tickets; answers under way when it is destroyed
+// are dropped.
 class GeoTickets {
  public:
   virtual ~GeoTickets() = default;
@@ -88,15 +89,14 @@ class GeoTickets {
                                                                          ShiftLocations shiftLocations,
                                                                          const GeoTraits* traits) = 0;
 
-  // A ticket for what is known of an address; absent: of the address under which this device is seen from
-  // outside. Never null.
+  // A ticket for the facts about an IP address; absent: this device's public address. Never null.
   virtual std::unique_ptr<GeoIpTicket> makeGeoIpTicket(const std::optional<std::string>& ipAddress) = 0;
 };
 
 // The platform's geo service: the look-ups, and the country that this device is configured for.
 class GeoService : public GeoTickets {
  public:
-  // The country code of the shared country configuration, or nothing. Reads small files at most.
+  // The country code of the shared country configuration, or nothing. Reads at most small files.
   virtual std::optional<std::string> currentCountryCode() = 0;
 };
 

@@ -21,15 +21,15 @@ enum class GunzipResult {
 // A gzip file in memory.
 struct GunzipInput {
   std::span<const std::byte> bytes;
-  // The sealed memory that holds these very bytes from its beginning, where there is one; -1: none. It can be
-  // handed to another process as it is.
+  // Sealed memory that holds exactly these bytes from its beginning, and can be sent to another process; -1:
+  // none. The caller owns it.
   int sealedMemory = -1;
 };
 
 struct GunzipOutcome {
   GunzipResult result = GunzipResult::unavailable;
-  std::uint64_t size = 0;  // of the output so far, what was only counted included
-  int writeError = 0;      // with `refused`, the number of the error of the write
+  std::uint64_t size = 0;  // bytes of output so far, including those only counted
+  int writeError = 0;      // with `refused`, the errno of the write
 };
 
 // Decompresses gzip files (RFC 1952), of one or several members. Any thread.
@@ -37,9 +37,9 @@ class Gunzip {
  public:
   virtual ~Gunzip() = default;
 
-  // Writes the output to a file, from where that stands, as long as there are at most `room` bytes of it.
-  // What goes beyond is only counted, up to `largestOutput`. The file is worth nothing unless the result is
-  // `whole` and the size within the room. An empty input is truncated.
+  // Writes at most `room` bytes of the output to a file, from its current position. Bytes beyond that are
+  // only counted, up to `largestOutput`. Use the file only if the result is `whole` and the size at most
+  // `room`. An empty input is `truncated`.
   virtual GunzipOutcome gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
                                    std::uint64_t largestOutput) noexcept = 0;
 };

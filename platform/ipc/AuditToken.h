@@ -17,7 +17,7 @@ struct AuditToken {
 
   std::uint32_t uid() const noexcept { return words[1]; }
   std::uint32_t gid() const noexcept { return words[2]; }
-  // -1 when the token names no process.
+  // -1 if the token names no process.
   pid_t pid() const noexcept { return words[5] == 0 ? -1 : static_cast<pid_t>(words[5]); }
   std::uint32_t pidVersion() const noexcept { return words[7]; }
 

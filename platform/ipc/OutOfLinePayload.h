@@ -10,16 +10,15 @@
 
 namespace brenvik {
 
-// A serialized property list (XML, no terminating NUL) in a region of its own, on its way to a caller. On
-// success it travels out of line with the reply, and the caller owns it there. Address and length 0: no
-// value.
+// A serialized property list (XML, no terminating NUL) in a region of its own, for a reply. On success the
+// reply carries it out of line, and the client then owns it. Address and length 0: no value.
 struct OutOfLinePayload {
   void* address = nullptr;
   std::uint32_t length = 0;  // bytes
 };
 
-// Copies already serialized bytes into a fresh region. payload->length is set in any case, payload->address
-// only on success; else the allocator's code is returned and nothing is left to free.
+// Copies serialized bytes into a new region. Always sets payload->length; sets payload->address only on
+// success. On failure returns the allocator's code, and there is nothing to free.
 inline KernelReturn fillPayload(RegionAllocator& regions, std::string_view bytes,
                                 OutOfLinePayload* payload) noexcept {
   payload->length = static_cast<std::uint32_t>(bytes.size());

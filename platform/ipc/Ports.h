@@ -12,11 +12,12 @@
 namespace brenvik {
 
 // The names of this process's ports and the rights behind them. A name is never 0 or 0xFFFFFFFF and is not
-// handed out again soon after it was freed. Main loop only.
+// reused soon after it was freed. Main loop only.
 //
-// A right has references. Whoever makes or adopts one drops it once; platform/ipc/Rights.h has owners that
-// do. Codes, where a member names no others: kern::success; kern::resourceShortage when the process or the
-// system is out of descriptors or memory; kern::invalidName when there is no such port.
+// A right has references. The code that makes or adopts a reference must drop it once; the classes of
+// platform/ipc/Rights.h do that. Unless a member says otherwise, it returns kern::success,
+// kern::resourceShortage if the process or the system is out of descriptors or memory, or kern::invalidName
+// if there is no such port.
 class PortSpace {
  public:
   virtual ~PortSpace() = default;
@@ -25,12 +26,12 @@ class PortSpace {
   // written.
   virtual KernelReturn allocateReceiveRight(PortName* name) noexcept = 0;
   // Makes one reference of a send right to the port from its receive right (make-send). The caller owns it.
-  // kern::invalidRight when the port has no receive right here.
+  // kern::invalidRight if this process does not hold the port's receive right.
   virtual KernelReturn insertSendRight(PortName name) noexcept = 0;
-  // Drops one reference of the receive right. With the last one the port dies and every holder of a send
-  // right sees a hang-up. kern::invalidRight, or invalidName, when there is no reference: nothing changes.
+  // Drops one reference of the receive right. With the last one the port dies, and every holder of a send
+  // right sees a hang-up. kern::invalidRight or invalidName if there is no reference; then nothing changes.
   virtual KernelReturn dropReceiveRight(PortName name) noexcept = 0;
-  // Drops one reference of a send right. kern::invalidRight, or invalidName, when there is none: nothing
+  // Drops one reference of a send right. kern::invalidRight or invalidName if there is none; then nothing
   // changes.
   virtual KernelReturn deallocateSendRight(PortName name) noexcept = 0;
 };
@@ -39,9 +40,9 @@ class PortSpace {
 class Bootstrap {
  public:
   virtual ~Bootstrap() = default;
-  // Obtains the receive right of the named service; the caller owns one reference. kern::noAccess when
-  // another live process holds the name, kern::failure when the service cannot be set up,
-  // kern::resourceShortage without memory. *receiveRight is written on success only.
+  // Obtains the receive right of the named service; the caller owns one reference. kern::noAccess if another
+  // live process holds the name, kern::failure if the service cannot be set up, kern::resourceShortage if
+  // memory runs out. Writes *receiveRight only on success.
   virtual KernelReturn checkIn(const char* serviceName, PortName* receiveRight) noexcept = 0;
 };
 
@@ -53,9 +54,10 @@ enum class WantTrailer : bool { no, yes };
 class RoutineSource {
  public:
   virtual ~RoutineSource() = default;
-  // Begins to serve on the loop, which outlives the source. False when the loop cannot watch the port.
+  // Begins to serve on the loop, which must outlive the source. Returns false if the loop cannot watch the
+  // port.
   virtual bool addTo(RunLoop& loop) noexcept = 0;
-  // Ends the serving, for good. The port stays.
+  // Stops serving for good. The port stays.
   virtual void invalidate() noexcept = 0;
 };
 
@@ -67,14 +69,14 @@ class DeathWatch {
   virtual PortName port() const noexcept = 0;
   // False once the port has died or the watch was invalidated.
   virtual bool isValid() const noexcept = 0;
-  // Runs once, from the run loop, after the port has died, also when it died before the callback was set.
-  // Empty: none. Invalidating the watch runs nothing.
+  // Sets the callback, which runs once, from the run loop, after the port has died, even if it died before
+  // the callback was set. Empty: no callback. Invalidating the watch does not run it.
   virtual void setInvalidationCallback(std::function<void(DeathWatch&)> callback) noexcept = 0;
   virtual void invalidate() noexcept = 0;
 };
 
-// Makes the sources above for ports of one PortSpace. Null when there is no such right, or the platform lacks
-// memory or descriptors. The table and the loop outlive what is made with them.
+// Makes the objects above for ports of one PortSpace. Returns null if there is no such right, or the platform
+// lacks memory or descriptors. The table and the loop must outlive the objects made with them.
 class PortSources {
  public:
   virtual ~PortSources() = default;

@@ -8,13 +8,13 @@
 
 namespace brenvik {
 
-// Memory for out-of-line regions of replies. A region handed to a reply is released by the transport once the
-// reply has gone out, or cannot; nobody else frees it. Main loop only.
+// Memory for out-of-line regions of replies. The transport releases a region of a reply once the reply was
+// sent or cannot be sent; nobody else frees it. Main loop only.
 class RegionAllocator {
  public:
   virtual ~RegionAllocator() = default;
-  // A fresh writable region of `length` bytes, anywhere; *address is null on failure. Its bytes are undefined
-  // until written: the caller fills it whole.
+  // Allocates a writable region of `length` bytes. On failure *address is null. The bytes are undefined: the
+  // caller must write all of them.
   virtual KernelReturn allocate(void** address, std::size_t length) noexcept = 0;
   // Releases a region that no reply carries.
   virtual void deallocate(void* address, std::size_t length) noexcept = 0;

@@ -8,8 +8,8 @@
 
 namespace brenvik {
 
-// Owns one reference of a right to a port and drops it when destroyed. Empty unless it names a port that can
-// be used. Main loop only; the port space outlives it.
+// Owns one reference of a right to a port and drops it when destroyed. Empty unless it names a usable port.
+// Main loop only; the port space must outlive it.
 template <KernelReturn (PortSpace::*drop)(PortName) noexcept>
 class PortRight {
  public:
@@ -25,14 +25,14 @@ class PortRight {
   }
   ~PortRight() { reset(); }
 
-  // kNullPort when empty.
+  // kNullPort if empty.
   PortName name() const noexcept { return name_; }
   explicit operator bool() const noexcept { return isUsablePort(name_); }
 
-  // Gives the reference up without dropping it.
+  // Gives up the reference without dropping it; the caller must drop it.
   PortName release() noexcept { return std::exchange(name_, kNullPort); }
   void reset() noexcept {
-    // It fails only for a right that has gone already.
+    // Fails only if the right has already gone.
     if (const PortName name = release(); isUsablePort(name)) (void)(ports_->*drop)(name);
   }
 

@@ -10,16 +10,15 @@
 
 namespace brenvik {
 
-// A received request, as the routine's handler sees it. The bytes are ours alone (no peer can change them),
-// the rights' names and the regions' addresses are filled in, and all of it stays valid until the reply has
-// been sent.
+// A received request, as the routine's handler sees it. No peer can change its bytes, the rights' names and
+// the regions' addresses are filled in, and everything stays valid until the reply has been sent.
 class Request {
  public:
   Request(std::byte* bytes, std::uint32_t size, const MessageTrailer* trailer) noexcept
       : bytes_(bytes), size_(size), trailer_(trailer) {}
 
   const MessageHeader& header() const noexcept { return *reinterpret_cast<const MessageHeader*>(bytes_); }
-  // The message's size as the receiver sees it, without trailer and in-line regions. Bytes.
+  // The message's size in bytes, without trailer and in-line regions.
   std::uint32_t size() const noexcept { return size_; }
   bool isComplex() const noexcept { return (header().bits & kComplexBit) != 0; }
   // Precondition: a complex message of at least 28 bytes.
@@ -38,8 +37,8 @@ class Request {
     return *reinterpret_cast<const Field*>(bytes_ + offset);
   }
 
-  // Type and size (kMinimalTrailerSize or the whole 52 bytes) are always there; the other fields only when
-  // the size says so.
+  // Type and size (kMinimalTrailerSize or the whole 52 bytes) are always valid; the other fields only if the
+  // size covers them.
   const MessageTrailer& trailer() const noexcept { return *trailer_; }
 
  private:
@@ -73,20 +72,20 @@ class Reply {
   std::byte* bytes_;
 };
 
-// What became of a request: whether the rights it carried are the routine's now or still the transport's.
+// Who owns the rights that a request carried: the routine (accepted) or still the transport (refused).
 enum class Outcome : bool { refused, accepted };
 
-// A table of routines to be served on a port. It and its context outlive every source that serves it.
+// A table of routines to be served on a port. It and its context must outlive every source that serves it.
 class RoutineTable {
  public:
   using Handler = Outcome (*)(void* context, const Request& request, Reply& reply);
 
   virtual ~RoutineTable() = default;
-  // The handler of a message id, or null: the request is then answered as one of unknown id. A handler leaves
-  // a complete reply. It allocates no memory for it but an out-of-line region. When it throws std::bad_alloc,
-  // the source answers with kern::resourceShortage and the request counts as refused.
+  // Returns the handler of a message id, or null for an unknown id. A handler must leave a complete reply,
+  // and may allocate only an out-of-line region for it. If it throws std::bad_alloc, the source answers with
+  // kern::resourceShortage and the request counts as refused.
   virtual Handler find(std::int32_t id) const noexcept = 0;
-  // What the handlers get as `context`. Asked after find().
+  // The `context` argument of the handlers. Called after find().
   virtual void* context() const noexcept = 0;
 };
 

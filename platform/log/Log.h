@@ -13,7 +13,7 @@ enum class LogLevel : int { error = 3, standard = 5, info = 6, debug = 7 };
 // Priorities of the BSD log, as syslog(3) numbers them.
 enum class SyslogPriority : int { error = 3, notice = 5 };
 
-// Where in the source a line was written.
+// The place in the source that wrote a line.
 struct LogPlace {
   const char* file;
   int line;
@@ -21,25 +21,25 @@ struct LogPlace {
       function;  // for a sink its name alone; in a call of logUnifiedAt the signature as the compiler has it
 };
 
-// The function's name in such a signature, without scope and arguments. For a lambda it is the name of the
+// Returns the function's name in such a signature, without scope and arguments; for a lambda, the name of the
 // enclosing function.
 std::string_view functionNameIn(std::string_view signature) noexcept;
 
-// The journal's name for a log text, 128 bits: made of the text itself as it stands in the source (FNV-1a),
-// so it stays as long as the text does. The catalogue that explains the texts is made by the same rule.
+// The journal's id for a log text, 128 bits. It is a hash (FNV-1a) of the text in the source, so it stays the
+// same as long as the text does. The catalogue that explains the texts uses the same rule.
 struct MessageId {
   std::uint64_t high = 0;
   std::uint64_t low = 0;
   bool operator==(const MessageId&) const = default;
 };
 
-// The id of a format, its trailing newline left out. A format of "%s" alone has no text of its own, so the id
-// is made of the line.
+// The id of a format, without its trailing newline. The format "%s" has no text of its own, so its id is made
+// from the line.
 MessageId messageIdOf(std::string_view format, std::string_view line) noexcept;
 
-// Where finished lines go. Implementations are called from any thread and never throw, block on a reader or
-// call back into the log. `line` is the whole text as written by the helper, control characters included;
-// escaping what a terminal or a log reader could misread is the sink's work.
+// Receives finished lines. Any thread may call it; implementations never throw, block on a reader or call
+// back into the log. `line` is the whole text as the helper wrote it, control characters included; the sink
+// must escape characters that a terminal or a log reader could misread.
 class LogSink {
  public:
   virtual ~LogSink() = default;
@@ -53,8 +53,8 @@ class LogSink {
 LogSink* setLogSink(LogSink* sink) noexcept;
 
 // Write one line to the unified log or to the BSD log. Any thread. A line longer than 4,096 bytes is cut.
-// Nothing is allocated; errno is left as it was. logUnified(level, format, ...) is a macro only so that the
-// journal can say where the line came from.
+// They allocate nothing and keep errno. logUnified(level, format, ...) is a macro only to pass the line's
+// place in the source to the journal.
 #define logUnified(...) ::brenvik::logUnifiedAt({__FILE__, __LINE__, __PRETTY_FUNCTION__}, __VA_ARGS__)
 [[gnu::format(printf, 3, 4)]] void logUnifiedAt(const LogPlace& place, LogLevel level, const char* format,
                                                 ...) noexcept;

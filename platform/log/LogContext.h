@@ -14,50 +14,51 @@
 #include <string>
 #include <string_view>
 
-// On whose behalf a line is written: fields that the journal keeps beside the text, so that
-// `journalctl BRENVIK_CALLER_EXE=/usr/libexec/brenvik/brenvikd` finds what one program has caused.
+// The client for which a line is written. The journal keeps it in fields beside the text, so that
+// `journalctl BRENVIK_CALLER_EXE=/usr/libexec/brenvik/brenvikd` finds the lines that one program has caused.
 namespace brenvik {
 
-// A client, as the journal shows it. Never changed, and shared by all that its requests set going.
+// A client, as the journal shows it. Immutable; all work that its requests start shares it.
 struct LogCaller {
   pid_t pid = 0;
   uid_t uid = 0;
-  std::string executable;  // empty: not known
-  std::string unit;        // empty: none, or not known
+  std::string executable;  // empty: unknown
+  std::string unit;        // empty: none, or unknown
 };
 
-// Which client a port was made for. Any thread.
+// Maps each port to the client that it was made for. Any thread.
 class LogCallers {
  public:
-  // The process's own.
+  // The process's own object.
   static LogCallers& shared();
 
   void add(std::uint32_t port, std::shared_ptr<const LogCaller> caller);
   void remove(std::uint32_t port) noexcept;
-  std::shared_ptr<const LogCaller> find(std::uint32_t port) const noexcept;  // null when not known
+  std::shared_ptr<const LogCaller> find(std::uint32_t port) const noexcept;  // null: unknown
 
  private:
   mutable std::mutex mutex_;
   std::map<std::uint32_t, std::shared_ptr<const LogCaller>> callers_;
 };
 
-// Whoever this thread works for. `routine` is the name of a routine of the protocol, with static storage.
+// The request that this thread works for. `routine` is the name of a routine of the protocol, with static
+// storage.
 struct LogContext {
   std::shared_ptr<const LogCaller> caller;
   std::string_view routine;
 };
 
-// While it lives, lines of this thread carry the fields. Scopes nest: the innermost counts. Making one costs
-// two stores, no allocation and no system call; a port is looked up only when a line is written or work is
-// handed on.
+// While it lives, lines of this thread carry the fields. Scopes nest; the innermost counts. Making one costs
+// two stores, no allocation and no system call; the port is looked up only when a line is written or work is
+// posted.
 class LogScope {
  public:
-  // A request that has come by a client's port.
+  // For a request that arrived on a client's port.
   LogScope(std::string_view routine, std::uint32_t port) noexcept
       : routine_(routine), port_(port), outer_(innermost) {
     innermost = this;
   }
-  // Work done for another thread's request. `context` must outlive this object.
+  // For work on another thread's request. `context` must outlive this object.
   explicit LogScope(const LogContext& context) noexcept
       : routine_(context.routine), context_(&context), outer_(innermost) {
     innermost = this;
@@ -66,7 +67,7 @@ class LogScope {
   LogScope& operator=(const LogScope&) = delete;
   ~LogScope() { innermost = outer_; }
 
-  // Of this thread; empty outside of any scope.
+  // This thread's context; empty outside any scope.
   static LogContext current() noexcept;
   static bool isActive() noexcept { return innermost != nullptr; }
 
@@ -79,11 +80,11 @@ class LogScope {
   const LogScope* const outer_;
 };
 
-// The task, to be run on another thread or later in the present context: its lines carry the same fields.
-// Outside of any scope that is the task itself.
+// Wraps a task that runs later or on another thread, so that its lines carry the fields of the current
+// context. Outside any scope it returns the task itself. Throws std::bad_alloc.
 std::function<void()> inCurrentLogContext(std::function<void()> task);
 
-// The fields of the line that this thread writes now, for sinks.
+// For sinks: the fields of the line that this thread is writing.
 class LogFields {
  public:
   struct Field {

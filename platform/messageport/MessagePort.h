@@ -14,7 +14,7 @@ namespace brenvik {
 class RemoteMessagePort {
  public:
   virtual ~RemoteMessagePort() = default;
-  // Hands one message over without waiting for room or for an answer. False when it was dropped.
+  // Sends one message without waiting for room or for an answer. Returns false if it was dropped.
   virtual bool send(std::int32_t messageId, std::span<const std::byte> data) noexcept = 0;
 };
 
@@ -22,7 +22,7 @@ class RemoteMessagePort {
 class MessagePorts {
  public:
   virtual ~MessagePorts() = default;
-  // Null when nobody listens under that name, or is too busy to. Never waits.
+  // Returns null if nobody listens under that name, or the listener is too busy. Never waits.
   virtual std::unique_ptr<RemoteMessagePort> openRemote(const std::string& name) noexcept = 0;
 };
 

@@ -14,7 +14,7 @@
 
 namespace brenvik {
 
-// What a send or a receive came to: bytes moved, or a negative count and the error's number.
+// The result of a send or a receive: the bytes moved, or a negative count and an errno.
 struct EchoTransfer {
   std::ptrdiff_t count = -1;
   int error = 0;
@@ -28,16 +28,16 @@ class EchoSocket {
 
   // Best effort: a failure is not reported.
   virtual void setReceiveBufferSize(int bytes) = 0;
-  // Lets packets out and in by this interface only. Best effort: a failure is not reported.
+  // Limits sending and receiving to this interface. Best effort: a failure is not reported.
   virtual void bindToInterface(unsigned index) = 0;
-  // How long receive() waits. 0, or the error's number.
+  // Sets how long receive() waits. Returns 0 or an errno.
   virtual int setReceiveTimeOut(std::chrono::microseconds timeOut) = 0;
 
-  // Sends the ICMP message with the identifier that stands in it.
+  // Sends the ICMP message with the identifier that it contains.
   virtual EchoTransfer sendTo(in_addr destination, std::span<const std::byte> message) = 0;
-  // Waits for the next datagram, which is cut to fit. EAGAIN when none came in time.
+  // Waits for the next datagram, which is cut to fit. EAGAIN if none arrives in time.
   virtual EchoTransfer receive(std::span<std::byte> buffer) = 0;
-  // Whether what is received begins with the IP header or with the ICMP message.
+  // Whether a received datagram begins with the IP header (true) or with the ICMP message.
   virtual bool deliversIpHeader() const noexcept = 0;
 };
 
@@ -50,11 +50,11 @@ class EchoNetwork {
   virtual std::optional<in_addr> addressOfHost(const char* name) = 0;
   // The number of a protocol by name, as getprotobyname(3) knows it.
   virtual std::optional<int> protocolByName(const char* name) = 0;
-  // A socket whose echo requests go out with `identifier` unchanged. Null when the system allows none.
+  // Opens a socket that sends echo requests with this `identifier`. Returns null if the system allows none.
   virtual std::unique_ptr<EchoSocket> openEchoSocket(int protocol, std::uint16_t identifier) = 0;
-  // 0 when there is no such interface.
+  // 0 if there is no such interface.
   virtual unsigned indexOfInterface(const char* name) = 0;
-  // The wall clock. 0, or -1 with errno, which may be left 0.
+  // Reads the wall clock. Returns 0, or -1 and sets errno, which may stay 0.
   virtual int timeOfDay(timeval* now) noexcept = 0;
   // A clock that only moves forward.
   virtual std::chrono::microseconds steadyTime() noexcept = 0;

@@ -13,7 +13,7 @@
 
 namespace brenvik {
 
-// The longest echo message that is sent or received; and the longest name that is looked up.
+// The longest echo message that is sent or received, and the longest name that is looked up, in bytes.
 inline constexpr std::size_t kLongestEcho = 4096;
 inline constexpr std::size_t kLongestName = 255;
 
@@ -24,12 +24,12 @@ struct EchoAnswer {
 };
 enum class EchoSocketForm : std::uint8_t { none = 0, withoutIpHeader = 1, withIpHeader = 2 };
 
-// Each has one field or few; a reader gives nothing when they are not all there and no more, or when no
-// correct program sends them. All throw std::bad_alloc.
+// Each message has a few fields. A decoder returns nothing if the message is malformed, has bytes left over,
+// or has values that no correct program sends. All throw std::bad_alloc.
 std::vector<std::byte> encodeName(const char* name);
 std::optional<std::string> decodeName(std::span<const std::byte> payload);
 std::vector<std::byte> encodeNumber(std::optional<std::uint32_t> number);
-// The outer one is about the form.
+// The outer optional is empty if the message is malformed.
 std::optional<std::optional<std::uint32_t>> decodeNumber(std::span<const std::byte> payload);
 
 std::vector<std::byte> encodeSocket(int protocol, std::uint16_t identifier);
@@ -48,7 +48,7 @@ struct EchoSendQuestion {
 };
 std::optional<EchoSendQuestion> decodeSend(std::span<const std::byte> payload);
 std::vector<std::byte> encodeTransfer(const EchoTransfer& transfer, std::span<const std::byte> bytes);
-// `largest`: of the count; the bytes are as many as the count says, or none.
+// `largest` limits the count. The number of bytes must equal the count, or be 0.
 std::optional<EchoAnswer> decodeTransfer(std::span<const std::byte> payload, std::size_t largest);
 
 }  // namespace brenvik

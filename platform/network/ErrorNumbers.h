@@ -6,7 +6,7 @@
 
 namespace brenvik {
 
-// 0, or a number that the kernel may give as an error.
+// True for 0 and for any number that the kernel may use as an errno.
 constexpr bool isErrorNumber(std::uint32_t number) noexcept { return number < 4096; }
 
 }  // namespace brenvik

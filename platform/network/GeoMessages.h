@@ -12,20 +12,21 @@
 
 namespace brenvik {
 
-// What became of a question: exactly one of the two is given.
+// The outcome of a question: exactly one of the two members has a value.
 template <typename Answer>
 struct GeoOutcome {
   std::optional<Answer> answer;
   std::optional<GeoError> error;
 };
 
-// A description is cut to this length, and refused beyond it: it is a line for people.
+// The longest description, in bytes. The sender cuts it, the receiver refuses a longer one: it is one line
+// for people.
 inline constexpr std::size_t kLongestGeoError = 1000;
-// Of an address together, in bytes.
+// The longest address, all parts together, in bytes.
 inline constexpr std::size_t kLongestAddress = 200'000;
 
-// Nothing when it is not such a question or outcome, or one that no correct program sends: a part of an
-// address that is empty, no UTF-8 or holds a NUL, a country code of anything but two capital letters, a
+// The decoders return nothing for a malformed message, and for one that no correct program sends: a part of
+// an address that is empty, not UTF-8 or contains a NUL; a country code that is not two capital letters; a
 // malformed public address. All throw std::bad_alloc.
 std::vector<std::byte> encode(const Coordinate& coordinate);
 std::optional<Coordinate> decodeCoordinate(std::span<const std::byte> payload);

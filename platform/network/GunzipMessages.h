@@ -12,7 +12,7 @@
 
 namespace brenvik {
 
-// One gzip file to be unpacked, as it goes to the worker: beside it travel the sealed memory that it lies in
+// A request to the worker to unpack one gzip file. Its descriptors are the sealed memory that holds the file
 // and the file to write to.
 struct GunzipQuestion {
   std::uint64_t inputSize = 0;
@@ -20,7 +20,7 @@ struct GunzipQuestion {
   std::uint64_t largestOutput = 0;
 };
 
-// Nothing when it is not such a question or outcome, or one that no correct program sends. All throw
+// The decoders return nothing for a malformed message, and for one that no correct program sends. All throw
 // std::bad_alloc.
 std::vector<std::byte> encode(const GunzipQuestion& question);
 std::optional<GunzipQuestion> decodeGunzipQuestion(std::span<const std::byte> payload);

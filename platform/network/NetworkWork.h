@@ -5,8 +5,8 @@
 #include <chrono>
 #include <cstdint>
 
-// What the helper and its network worker agree on: the sorts of work, one a channel, and the kinds of
-// messages on such a channel. Both programs come from one build.
+// The protocol between the helper and its network worker: the kinds of work, one for each channel, and the
+// kinds of messages on a channel. Both programs come from one build.
 namespace brenvik {
 
 // The worker's named service in the bootstrap directory.
@@ -16,20 +16,20 @@ enum class NetworkWork : std::uint32_t {
   web = 1,             // one HTTP request
   gunzip = 2,          // one gzip file
   reverseGeocode = 3,  // the address at one coordinate
-  publicAddress = 4,   // the address under which this device is seen from outside
-  echo = 5,            // look-ups and one echo socket: a question and its answer at a time
+  publicAddress = 4,   // this device's public address
+  echo = 5,            // look-ups and one echo socket: one question and its answer at a time
 };
 
-// On a channel of any work but `echo`: the helper asks once; the worker says now and then that it is at work,
-// and answers once, or says that it has no memory, thread or room for this one. A channel that hangs up
-// without either is that of a worker that is gone.
+// Messages of all work but `echo`. The helper asks once. The worker sends `alive` from time to time and
+// answers once, or refuses because it has no memory, thread or room. If the channel hangs up without either,
+// the worker has died.
 enum class NetworkMessage : std::uint32_t { ask = 1, alive = 2, answer = 3, refusal = 4 };
 
-// How often a worker says that it is at work, and how long it may say nothing before it counts as hung.
+// How often a worker sends `alive`, and how long it may be silent before it counts as hung.
 inline constexpr std::chrono::seconds kAliveInterval{5};
 inline constexpr std::chrono::seconds kLongestSilence{30};
 
-// On a channel of `echo`. An answer has the kind of its question; those marked have none.
+// Messages of `echo`. An answer has the kind of its question; the marked questions have no answer.
 enum class EchoMessageKind : std::uint32_t {
   addressOfHost = 1,
   protocolByName = 2,
@@ -40,7 +40,7 @@ enum class EchoMessageKind : std::uint32_t {
   setReceiveTimeOut = 7,
   sendTo = 8,
   receive = 9,
-  refusal = 10,  // in the place of any answer: no memory, thread or room
+  refusal = 10,  // instead of any answer: no memory, thread or room
 };
 
 }  // namespace brenvik

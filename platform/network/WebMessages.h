@@ -14,7 +14,7 @@
 
 namespace brenvik {
 
-// One HTTP request, as it goes to the worker.
+// One HTTP request to the worker.
 struct WebQuestion {
   WebRequestType type = WebRequestType::get;
   std::string url;
@@ -24,7 +24,7 @@ struct WebQuestion {
   std::uint64_t largestBody = kLargestWebBody;
 };
 
-// What the worker says of it. The body travels beside it, in sealed memory of exactly `bodySize` bytes.
+// The worker's answer. The body travels in sealed memory of exactly `bodySize` bytes.
 struct WebAnswer {
   WebErrorKind errorKind = WebErrorKind::unknown;
   int statusCode = 0;
@@ -32,8 +32,8 @@ struct WebAnswer {
   std::uint64_t bodySize = 0;
 };
 
-// Nothing when it is not such a question or answer, or one that no correct program sends: of a body larger
-// than `largestBody`, or beside a failure; of texts with NUL bytes or line breaks in them. All throw
+// The decoders return nothing for a malformed message, and for one that no correct program sends: with a body
+// larger than `largestBody`, with a body and a failure, or with NUL bytes or line breaks in texts. All throw
 // std::bad_alloc.
 std::vector<std::byte> encode(const WebQuestion& question);
 std::optional<WebQuestion> decodeWebQuestion(std::span<const std::byte> payload);

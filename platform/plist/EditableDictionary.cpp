@@ -188,7 +188,7 @@ std::size_t EditableDictionary::rankOf(std::string_view keyObject) const noexcep
   return static_cast<std::size_t>(at - byKey_.begin());
 }
 
-// Without the index, whoever reads a value or two looks through the keys; making it would take longer.
+// A caller that reads only a value or two searches the keys without the index; making it would take longer.
 std::size_t EditableDictionary::entryOf(std::string_view keyObject) const noexcept {
   if (byKey_.size() == entries_.size()) {
     const std::size_t rank = rankOf(keyObject);

@@ -19,51 +19,51 @@ class ObjectWriter;
 }
 
 // A dictionary that is changed entry by entry and written as a whole after each change. It is kept in the
-// form of its file, a binary property list: setting a value touches the bytes and numbers of that entry, so
-// that a change among 10,000 entries costs little more than one among ten. See
+// form of its file, a binary property list. Setting a value touches only the bytes and numbers of that entry,
+// so a change among 10,000 entries costs little more than one among ten. See
 // docs/decisions/04-editable-domains.md.
 //
-// Not for several threads at once. Every function but the queries of size may throw std::bad_alloc; an object
-// that set() threw from may only be assigned to or destroyed.
+// One thread at a time. Every function except size() and memory() may throw std::bad_alloc; after set() has
+// thrown, the object may only be assigned to or destroyed.
 class EditableDictionary {
  public:
-  // Bytes that the file may have.
+  // The largest file, in bytes.
   static constexpr std::size_t kMaxFileSize = std::size_t{32} << 20;
 
-  // Without entries; allocates nothing.
+  // Makes an empty dictionary; allocates nothing.
   EditableDictionary();
 
-  // A copy of the dictionary. Nothing when the value is not a dictionary, or is beyond the limits of property
-  // lists.
+  // Returns a copy of the dictionary; nothing if the value is not a dictionary, or exceeds the limits of
+  // property lists.
   static std::optional<EditableDictionary> of(const PropertyList& dictionary);
 
   // Number of entries.
   std::size_t size() const noexcept { return entries_.size(); }
-  // Bytes of memory held, about.
+  // The memory held, in bytes, approximately.
   std::size_t memory() const noexcept {
     return objects_.capacity() + tail_.capacity() +
            sizeof(std::uint32_t) * (offsets_.capacity() + entries_.capacity() + byKey_.capacity());
   }
 
-  // The key's value, with memory of its own; no value when there is none.
+  // Returns the key's value, with memory of its own; no value if there is none.
   PropertyList find(std::string_view key) const;
 
   enum class Change {
     none,  // the entry was already so
     made,
-    // Nothing has changed: with this entry the dictionary could not be read again (too deep, too large), or
-    // the key is not valid UTF-8.
+    // Nothing has changed, because the dictionary could not be read again with this entry (too deep, too
+    // large), or because the key is not valid UTF-8.
     refused,
   };
   // Sets the key's value; an absent value removes the entry.
   Change set(std::string_view key, const PropertyList& value);
 
-  // The file's content, in two pieces to be written one behind the other; valid until the next change.
+  // Returns the file's content in two pieces, to be written one after the other; valid until the next change.
   std::array<std::string_view, 2> content();
 
  private:
   struct Draft;
-  // Where an entry's objects lie: the key, its value, what the value refers to.
+  // The place of an entry's objects: the key, its value, and the objects that the value refers to.
   struct Range {
     std::size_t firstObject;
     std::size_t endObject;
@@ -93,7 +93,7 @@ class EditableDictionary {
   std::vector<std::uint32_t> entries_;  // the number of each entry's key, ascending
   std::vector<std::uint32_t> byKey_;    // places in entries_, ordered by key object; empty until needed
   std::size_t referenceWidth_ = 1;
-  // Of everything ever put in, so at least what the XML form takes: its bytes, and its lines.
+  // Upper limits of the XML form's bytes and lines: the sums over all values ever set.
   std::uint64_t xmlBytes_ = 0;
   std::uint64_t xmlLines_ = 0;
   std::string tail_;  // the rest of the file, made by content()

@@ -23,7 +23,7 @@ enum class Tag : std::uint8_t {
   array,
   dictionary,
   foreign,  // a value that another document owns
-  pending,  // only inside a reader: begun and not finished
+  pending,  // only inside a reader: begun but not finished
 };
 
 // One value, 16 bytes. Strings, data and children lie in the arena of a Document (or are constants of the

@@ -15,11 +15,11 @@
 
 namespace brenvik {
 
-// An immutable property-list value, or no value at all. Copies share what they hold; a value may be read
-// from any thread. Destroying the deepest or most shared value takes no recursion. What makes a value of a
-// text or of other values, and comparison, may throw std::bad_alloc; nothing else throws.
+// An immutable property-list value, or no value at all. Copies share their contents; any thread may read a
+// value. Destroying even the deepest or most shared value needs no recursion. Functions that make a value
+// from a text or from other values, and comparison, may throw std::bad_alloc; nothing else throws.
 //
-// A value taken out of a parsed document keeps that document's memory alive as long as it lives.
+// A value taken from a parsed document keeps that document's memory alive as long as it lives.
 class PropertyList {
  public:
   enum class Type : std::uint8_t { boolean, integer, real, string, data, date, array, dictionary };
@@ -38,16 +38,17 @@ class PropertyList {
   static PropertyList integer(std::int64_t value) noexcept;
   static PropertyList unsignedInteger(std::uint64_t value) noexcept;
   static PropertyList real(double value) noexcept;
-  static PropertyList string(std::string_view utf8);  // no value when it is not valid UTF-8
+  static PropertyList string(std::string_view utf8);  // no value if it is not valid UTF-8
   static PropertyList data(std::span<const std::byte> bytes);
   static PropertyList date(double secondsSince2001) noexcept;            // since 2001-01-01T00:00:00Z
   static PropertyList array(const std::vector<PropertyList>& elements);  // absent elements are left out
-  // Keys in the order given; of equal keys the last value stands. Absent values are left out. No value when
+  // Keys keep their order; if keys are equal, the last value counts. Absent values are left out. No value if
   // a key is not valid UTF-8.
   static PropertyList dictionary(const std::vector<std::pair<std::string, PropertyList>>& entries);
 
-  // A dictionary with the entry set (in its old place, or last) or, with an absent value, without it. Costs
-  // one pass over the entries. No value when this is not a dictionary or the key is not valid UTF-8.
+  // Returns a copy of this dictionary with the entry set (in its old place, or last) or, if `value` is
+  // absent, removed. Takes one pass over the entries. No value if this is not a dictionary or the key is not
+  // valid UTF-8.
   PropertyList withEntry(std::string_view key, const PropertyList& value) const;
 
   bool hasValue() const noexcept { return node_.tag != plist::Tag::none; }
@@ -56,7 +57,7 @@ class PropertyList {
   Type type() const noexcept;
   bool is(Type wanted) const noexcept { return hasValue() && type() == wanted; }
 
-  // Nothing when there is no value or it has another type. Views live as long as any copy of the value.
+  // Return nothing if there is no value or it has another type. Views live as long as any copy of the value.
   std::optional<bool> asBoolean() const noexcept;
   std::optional<std::int64_t> asInteger() const noexcept;           // nothing, too, above INT64_MAX
   std::optional<std::uint64_t> asUnsignedInteger() const noexcept;  // nothing, too, below 0
@@ -65,17 +66,18 @@ class PropertyList {
   std::optional<std::span<const std::byte>> asData() const noexcept;
   std::optional<double> asDate() const noexcept;
 
-  // Of an array or a dictionary: the number of elements or entries; 0 for everything else.
+  // The number of elements or entries of an array or a dictionary; 0 for other types.
   std::size_t size() const noexcept { return node_.isContainer() ? node_.size : 0; }
-  // Element of an array, value of a dictionary's entry, in order; no value when out of range.
+  // The element of an array, or the value of a dictionary's entry, in order; no value if out of range.
   PropertyList at(std::size_t index) const noexcept;
-  // Key of a dictionary's entry, in order; empty when out of range.
+  // The key of a dictionary's entry, in order; empty if out of range.
   std::string_view keyAt(std::size_t index) const noexcept;
-  // Value under the key of a dictionary; no value when absent or not a dictionary. Constant time.
+  // The value under the key of a dictionary; no value if it is absent or this is not a dictionary. Constant
+  // time.
   PropertyList find(std::string_view key) const noexcept;
 
-  // Deep equality, in time linear in what is stored however much of it is shared. Dictionaries compare
-  // without regard to order; a real that is not a number equals another one.
+  // Deep equality, in time linear in the stored objects, however much is shared. The order of a dictionary's
+  // entries does not matter; a real that is not a number (NaN) equals another one.
   bool operator==(const PropertyList& other) const;
 
  private:

@@ -4,11 +4,12 @@
 
 namespace brenvik {
 
-// The wireless radio manager, of which one switch is used. Main loop only; never waits for the service.
+// The wireless radio manager; the helper uses only one switch of it. Main loop only; never waits for the
+// service.
 class RadioManager {
  public:
   virtual ~RadioManager() = default;
-  // Logging to file on or off. Nothing is reported: where the service is absent, nothing happens.
+  // Turns logging to a file on or off. Reports nothing; without the service, it does nothing.
   virtual void setLogToFile(bool enable) noexcept = 0;
 };
 

@@ -6,9 +6,9 @@
 
 namespace brenvik {
 
-// Runs `work` on the queue and returns when it has run. It gets its turn however long memory is short:
-// posting is tried again every 10 ms. For the end of objects that somebody else waits for. Not on the queue
-// itself; `work` throws nothing.
+// Runs `work` on the queue and returns when it has run. If memory is short, it tries to post every 10 ms
+// until it succeeds. For destructors and the like, which must complete. Do not call it on the queue itself;
+// `work` must not throw.
 void runAndWait(WorkQueue& queue, const WorkQueue::Task& work) noexcept;
 
 }  // namespace brenvik

@@ -9,15 +9,15 @@
 
 namespace brenvik {
 
-// Something a run loop or a work queue watches: a descriptor or a timer. Destroying it, or invalidating it,
-// ends the watching; its handler does not run again afterwards. Both may be done from within the handler.
+// A descriptor or a timer that a run loop or a work queue watches. Destroying or invalidating it ends the
+// watching; its handler does not run again afterwards. Both may be done within the handler.
 class LoopSource {
  public:
   virtual ~LoopSource() = default;
   virtual void invalidate() noexcept = 0;
 };
 
-// What a watcher wants to know of a descriptor. Whatever it is, a hang-up and an error are reported as well.
+// The events of a descriptor that a watcher waits for. A hang-up and an error are always reported as well.
 enum class Interest : std::uint8_t { none, reading, writing, readingAndWriting };
 
 constexpr Interest interestIn(bool reading, bool writing) noexcept {
@@ -25,7 +25,7 @@ constexpr Interest interestIn(bool reading, bool writing) noexcept {
   return writing ? Interest::writing : Interest::none;
 }
 
-// What has become of a watched descriptor.
+// The events of a watched descriptor.
 struct Readiness {
   bool isReadable = false;
   bool isWritable = false;
@@ -38,7 +38,7 @@ struct Readiness {
 // A watched descriptor, whose interest can be changed.
 class DescriptorSource : public LoopSource {
  public:
-  // False when the kernel refused: then the interest is as before. Loop thread only.
+  // Returns false if the kernel refuses; the interest then stays as it was. Loop thread only.
   virtual bool setInterest(Interest interest) noexcept = 0;
 };
 
@@ -51,30 +51,30 @@ enum class RunResult : std::int32_t {
 
 enum class ReturnAfterSource : bool { no, yes };
 
-// The event loop of one thread: descriptors, timers, and (platform/runloop/WorkQueue.h) the main queue.
-// Unless a member says otherwise, call it on the loop's own thread only.
+// The event loop of one thread: it serves descriptors, timers, and the main queue
+// (platform/runloop/WorkQueue.h). Unless a member says otherwise, call it on the loop's own thread only.
 class RunLoop {
  public:
   using DescriptorHandler = std::function<void(Readiness)>;
 
   virtual ~RunLoop() = default;
 
-  // Runs the sources until stopped, timed out, or (when asked) until one source was handled. A time-out
-  // beyond what the clock can say, the largest finite double included, means none. Seconds.
+  // Runs the sources until stopped, timed out, or (if asked) until one source was handled. `timeOut` is in
+  // seconds; a value beyond the clock's range, such as the largest finite double, means no time-out.
   virtual RunResult run(std::chrono::duration<double> timeOut, ReturnAfterSource returnAfterSource) = 0;
 
-  // Makes the present run() return, or the next one when none is under way. Any thread.
+  // Makes the current run() return, or the next one if none is under way. Any thread.
   virtual void stop() noexcept = 0;
 
-  // Watches a descriptor, level-triggered; the descriptor stays the caller's and must outlive the source.
-  // Null when the kernel refused. Throws std::bad_alloc.
+  // Watches a descriptor, level-triggered. The caller still owns the descriptor, which must outlive the
+  // source. Returns null if the kernel refuses. Throws std::bad_alloc.
   virtual std::unique_ptr<DescriptorSource> addDescriptor(int fd, Interest interest,
                                                           DescriptorHandler handler) = 0;
 
-  // A repeating timer: first after `first`, then every `interval` (zero: once only). Descriptors that are
-  // ready at the same moment are served before it. Null when it cannot be made. Any thread, as is the
-  // source's destruction; off the loop's thread the timer may still fail to be armed later, and then
-  // `failed` runs on the loop's thread in the handler's place. Throws std::bad_alloc.
+  // Makes a repeating timer: first after `first`, then every `interval` (zero: once only). Descriptors that
+  // are ready at the same moment are served before it. Returns null if it cannot be made. Any thread may make
+  // and destroy it. If another thread than the loop's makes it, arming may fail later; then `failed` runs on
+  // the loop's thread instead of the handler. Throws std::bad_alloc.
   virtual std::unique_ptr<LoopSource> addTimer(std::chrono::nanoseconds first,
                                                std::chrono::nanoseconds interval,
                                                std::function<void()> handler,

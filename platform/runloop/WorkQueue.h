@@ -15,14 +15,14 @@
 
 namespace brenvik {
 
-// How urgent a queue's work is: `standard` gives the thread the priority of the process, whichever thread
+// How urgent a queue's work is. `standard` gives its thread the priority of the process, whichever thread
 // starts it; `utility` gives it nice 10 and the lowest best-effort I/O priority.
 enum class QualityOfService { standard, utility };
 
-// A serial queue: tasks run one at a time, in the order posted. All members may be called from any thread
-// that keeps the queue alive meanwhile. Destroying the last reference to a queue lets the task that runs
-// finish, drops the tasks and timers that have not started, and joins the queue's thread (unless it is
-// destroyed on that very thread).
+// A serial queue: tasks run one at a time, in the order posted. Any thread that keeps the queue alive
+// meanwhile may call any member. Destroying the last reference to a queue lets the running task finish, drops
+// the tasks and timers that have not started, and joins the queue's thread (unless it is destroyed on that
+// thread).
 class WorkQueue {
  public:
   using Task = std::function<void()>;
@@ -31,23 +31,23 @@ class WorkQueue {
 
   virtual const std::string& label() const noexcept = 0;
 
-  // Queues the task and returns. A task that throws std::bad_alloc is given up, with a line in the log; it
-  // must throw nothing else. Throws std::bad_alloc (OutOfQueues when the queue's thread cannot be started)
-  // and has then queued nothing.
+  // Queues the task and returns. A task that throws std::bad_alloc is abandoned and logged; it must throw
+  // nothing else. post() throws std::bad_alloc (OutOfQueues if the queue's thread cannot be started), and has
+  // then queued nothing.
   virtual void post(Task task) = 0;
 
-  // Runs the task once, `delay` from now (a clock that counts while the system sleeps). It cannot be
-  // cancelled. Throws as post() does. When the delay cannot be timed, the task runs at once.
+  // Runs the task once, `delay` from now (on a clock that counts while the system sleeps). It cannot be
+  // cancelled. Throws as post() does. If no timer can be made, the task runs at once.
   virtual void postAfter(std::chrono::nanoseconds delay, Task task) = 0;
 
-  // A timer whose handler runs on this queue: first after `first`, then every `interval`; a firing may be put
-  // off by up to `leeway` so that wake-ups coincide. Ticks that fall while the handler runs become one. The
-  // timer is inactive until activated. Null when it cannot be made. Throws as post() does.
+  // A timer whose handler runs on this queue: first after `first`, then every `interval`; each may be late by
+  // up to `leeway`, so that wake-ups coincide. Several ticks while the handler runs become one. The timer is
+  // inactive until activated. Null if it cannot be made. Throws as post() does.
   class Timer {
    public:
     virtual ~Timer() = default;  // cancels
-    // False when the system cannot time it, so that it will never fire; off the queue that is not known yet.
-    // Throws std::bad_alloc.
+    // Returns false if the system cannot time it, so that it will never fire. Called on another thread than
+    // the queue's, it may return true and still fail later. Throws std::bad_alloc.
     virtual bool activate() = 0;
     virtual void cancel() noexcept = 0;
   };
@@ -57,25 +57,25 @@ class WorkQueue {
   // True on the thread (or within the manual run) that runs this queue's tasks.
   virtual bool isCurrent() const noexcept = 0;
 
-  // Watches a descriptor on this queue, level-triggered: for drivers of libraries that poll. To be called and
-  // destroyed on the queue itself. Null when the kernel refused or the queue has no descriptors (fakes).
-  // Throws std::bad_alloc.
+  // Watches a descriptor on this queue, level-triggered, for drivers of libraries that poll. Call it, and
+  // destroy the source, on the queue itself. Returns null if the kernel refuses or the queue has no
+  // descriptors (fakes). Throws std::bad_alloc.
   virtual std::unique_ptr<DescriptorSource> watchDescriptor(int fd, Interest interest,
                                                             RunLoop::DescriptorHandler handler) = 0;
 };
 
-// Watches one process and tells, once, on the queue it was made with, that it has exited.
+// Watches one process and calls its handler once, on WorkQueues::global(), after the process has exited.
 class ProcessExitSource {
  public:
   virtual ~ProcessExitSource() = default;  // cancels without calling the cancel handler
   // Begins to watch. Throws std::bad_alloc, and then watches nothing.
   virtual void activate() = 0;
-  // Ends the watching. The cancel handler runs once, afterwards, on the queue.
+  // Stops watching. The cancel handler then runs once, on the queue.
   virtual void cancel() noexcept = 0;
 };
 
-// The system has no descriptor, thread or memory left for a queue. A kind of bad_alloc: whoever copes with
-// lack of memory copes with this.
+// The system has no descriptor, thread or memory left for a queue. It derives from bad_alloc, so code that
+// handles a lack of memory handles this, too.
 class OutOfQueues : public std::bad_alloc {
  public:
   const char* what() const noexcept override { return "no descriptor or thread is left for a work queue"; }
@@ -92,15 +92,15 @@ class WorkQueues {
   // The process-wide default-priority queue for short handlers. Throws OutOfQueues.
   virtual WorkQueue& global() = 0;
 
-  // A new serial queue; its thread starts with its first task. Never null, and never a queue that shares its
-  // thread with another: throws OutOfQueues, as the posting of the first task may.
+  // Makes a serial queue with a thread of its own, which starts with the first task. Never returns null.
+  // Throws OutOfQueues, and so may the first post().
   virtual std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) = 0;
 
-  // Watches the process `pid` of that version: ids are used again, and the version tells one process from the
-  // others that had its id (processStartTime() in platform/base/ProcessFacts.h). The event handler runs on
-  // global(), once the main run loop runs. It also runs when that process is gone already, when the id names
-  // another process, and when the system lacks what it takes to watch it. Null when the kernel gives no
-  // descriptor for it. Throws std::bad_alloc.
+  // Watches the process `pid` with this `version` (ProcessFacts::startTime in platform/base/ProcessFacts.h),
+  // which tells it from other processes that had the same id. The event handler runs on global(), once the
+  // main run loop runs. It also runs if that process has already gone, if the id now belongs to another
+  // process, and if the system cannot watch it. Returns null if the kernel has no descriptor for it. Throws
+  // std::bad_alloc.
   virtual std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t version,
                                                                    WorkQueue::Task onExit,
                                                                    WorkQueue::Task onCancel) = 0;

@@ -11,22 +11,22 @@
 
 namespace brenvik {
 
-// One caller, pinned: a task object lives for one question and belongs to one thread.
+// One caller. A task object lives for one question, refers to exactly one process, and belongs to one thread.
 class SecurityTask {
  public:
   struct Answer {
-    PropertyList value;  // none when the caller does not hold the entitlement
-    bool error = false;  // the question could not be answered; the value, if any, is not to be trusted
+    PropertyList value;  // none if the caller does not hold the entitlement
+    bool error = false;  // the question could not be answered; do not trust the value
   };
 
   virtual ~SecurityTask() = default;
   virtual Answer copyEntitlement(std::string_view name) noexcept = 0;
 
-  // For people: why copyEntitlement has no value true for this name, in half a sentence. Costs more than the
-  // question. Empty when memory is lacking.
+  // For people: explains in half a sentence why copyEntitlement has no value true for this name. Costs more
+  // than the question. Empty if memory runs out.
   virtual std::string explainRefusal(std::string_view name) noexcept = 0;
-  // For people: the path of what the caller executes, and the unit of the service manager that it runs in;
-  // each empty when it is not known. Throws std::bad_alloc.
+  // For people: the path of the caller's executable, and the unit of the service manager that it runs in;
+  // each is empty if unknown. Throws std::bad_alloc.
   struct Caller {
     std::string executable;
     std::string unit;
@@ -34,13 +34,14 @@ class SecurityTask {
   virtual Caller describeCaller() const = 0;
 };
 
-// The platform's task-security service: which entitlements has the process that sent a message?
+// The platform's task-security service: tells which entitlements the sender of a message holds.
 class TaskSecurity {
  public:
   virtual ~TaskSecurity() = default;
-  // Null when the process of the token is gone, is another one by now, or is one that can hold nothing.
+  // Returns null if the token's process has exited, if another process has its id, or if it cannot hold any
+  // entitlement.
   virtual std::unique_ptr<SecurityTask> makeTask(const AuditToken& caller) noexcept = 0;
-  // For people: why makeTask made none, in half a sentence. Empty when memory is lacking.
+  // For people: explains in half a sentence why makeTask returned null. Empty if memory runs out.
   virtual std::string explainNoTask(const AuditToken& caller) noexcept = 0;
 };
 

@@ -9,10 +9,11 @@
 
 namespace brenvik {
 
-// How long all that is done with a database may take in all, from construction on: waiting for the locks of
-// other programs and running statements, whatever triggers and expressions their owner has put there. After
-// it, waiting ends with SQLITE_BUSY and a running statement with SQLITE_INTERRUPT. Reading and writing pages
-// below a statement (undoing a transaction, above all) is not cut off, so leave room for that.
+// Limits the total time of all work with a database, counted from construction: waiting for the locks of
+// other programs and running statements, with any triggers and expressions that the database's owner has put
+// there. After that, waiting ends with SQLITE_BUSY and a running statement with SQLITE_INTERRUPT. Reading and
+// writing pages below a statement (above all, rolling back a transaction) is not limited, so leave time for
+// that.
 class SqliteTimeLimit {
  public:
   SqliteTimeLimit(std::chrono::milliseconds whole, SqliteTime time);
@@ -21,9 +22,9 @@ class SqliteTimeLimit {
 
   bool isOver() const noexcept { return time_.now() >= end_; }
 
-  // From here on, until the connection is closed or lift() is called. The object outlives that.
+  // Applies the limit until the connection is closed or lift() is called. The object must live that long.
   void applyTo(sqlite3* database) noexcept;
-  // For what must be finished, however late it is: undoing a transaction.
+  // Removes the limit, for work that must complete even when it is late: rolling back a transaction.
   static void lift(sqlite3* database) noexcept;
 
  private:

@@ -6,14 +6,13 @@
 
 namespace brenvik {
 
-// The path by which SQLite finds a file in a folder that is open as this descriptor: not by the folder's
-// place, so that it may stand where this account cannot look, or have been moved. Only for sqlite()'s
-// functions, and as long as the descriptor is open.
+// Returns a path by which SQLite finds a file in the folder with this open descriptor. The path does not
+// depend on the folder's place, so the folder may be where this account cannot look, or may have been moved.
+// It works only for sqlite()'s functions, and as long as the descriptor is open. Throws std::bad_alloc.
 std::string pathInHeldFolder(int folder, const char* name);
 
-// Has SQLite's way to files (the default one of sqlite3_vfs_find(3)) understand such paths, and open files
-// without waiting for whoever is at the other end of a pipe. Takes its xSetSystemCall; false when that
-// refuses.
+// Makes SQLite's file layer (the default VFS, see sqlite3_vfs_find(3)) understand such paths, and open files
+// without waiting for the other end of a pipe. Takes the VFS's xSetSystemCall; returns false if that refuses.
 using SqliteSetSystemCall = bool (*)(void* files, const char* name, void (*function)());
 bool understandHeldFolders(void* files, SqliteSetSystemCall set) noexcept;
 

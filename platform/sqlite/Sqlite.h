@@ -29,12 +29,12 @@ struct SqliteFunctions {
 #undef BRENVIK_SQLITE_MEMBER
 };
 
-// Bytes that SQLite may have at once, for all connections of the process: ten times what a remap of 100,000
-// contacts takes. A statement that needs more fails with SQLITE_NOMEM.
+// The most memory, in bytes, for all of SQLite's connections of the process: ten times what a remap of
+// 100,000 contacts needs. A statement that needs more fails with SQLITE_NOMEM.
 inline constexpr std::int64_t kMaxSqliteMemory = std::int64_t{32} << 20;
 
 // Loads the library if it is not loaded yet, and returns its functions, valid for the life of the process.
-// Null when there is no usable library, or when memory did not suffice to load it: *lackedMemory, if given,
+// Returns null if there is no usable library, or if memory ran out while loading it; *lackedMemory, if given,
 // tells the two apart. The next call tries again. Any thread. The library may use kMaxSqliteMemory, and opens
 // a pipe without waiting for its other end.
 const SqliteFunctions* sqlite(bool* lackedMemory = nullptr) noexcept;

@@ -10,20 +10,20 @@
 
 namespace brenvik {
 
-// The contacts, changed by the store worker. A manager has a channel of its own, which gets the descriptor of
-// the folder as it was found when the manager was made.
+// The contacts, which the store worker changes. Each manager has its own channel, and sends the worker the
+// descriptor of the folder that was found when the manager was made.
 class RemoteContacts final : public ContactsService {
  public:
-  // From the making of a manager on: the two seconds that it takes at most for other programs and their
-  // statements, and the time for undoing what was written meanwhile.
+  // The time limit from the construction of a manager: two seconds at most for other programs and their
+  // statements, and the time for rolling back.
   static constexpr std::chrono::milliseconds kPatience{3000};
 
-  // Both outlive this object and its managers.
+  // Both must outlive this object and its managers.
   RemoteContacts(Worker& worker, StoreFolder& folder, std::chrono::milliseconds patience = kPatience)
       : worker_(worker), folder_(folder), patience_(patience) {}
 
-  // If the worker cannot be reached there is still a manager; its remap fails and says why. Null would mean
-  // that there are no contacts.
+  // If the worker cannot be reached, it still returns a manager, whose remap fails and says why, because null
+  // would mean that there are no contacts.
   std::unique_ptr<ContactsChannelManager> makeChannelManager() override;
 
  private:

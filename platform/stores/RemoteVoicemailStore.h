@@ -14,16 +14,16 @@
 
 namespace brenvik {
 
-// The voicemail store, kept by the store worker. The folder is looked for here with each operation, and the
-// worker gets its descriptor; it is made for "mobile" by the first change. A worker that is too late is given
-// up, and the operation has failed like one of the store's.
+// The voicemail store, which the store worker keeps. Each operation looks for the folder here and sends the
+// worker its descriptor; the first change makes the folder for "mobile". If the worker misses its deadline,
+// it is given up, and the operation counts as a failure of the store.
 class RemoteVoicemailStore final : public VoicemailStore {
  public:
-  // How long an operation is waited for: the second that the store itself takes at most for other processes
-  // and their statements, and what the disk takes.
+  // The time limit of an operation: at most one second that the store takes for other processes and their
+  // statements, and the time that the disk takes.
   static constexpr std::chrono::milliseconds kPatience{1500};
 
-  // Both outlive this object.
+  // Both must outlive this object.
   RemoteVoicemailStore(Worker& worker, StoreFolder& folder, std::chrono::milliseconds patience = kPatience)
       : worker_(worker), folder_(folder), patience_(patience) {}
 

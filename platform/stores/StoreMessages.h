@@ -11,8 +11,9 @@
 
 #include "platform/worker/WorkerMessage.h"
 
-// What the helper and the store worker say to each other. Each request has one answer, and the next one comes
-// after it. Encoding throws std::bad_alloc, and so does decoding; what does not have the form is nothing.
+// The protocol between the helper and the store worker. Each request has one answer, and the next request
+// follows that answer. Encoding and decoding throw std::bad_alloc; decoding returns nothing for a malformed
+// message.
 namespace brenvik::stores {
 
 inline constexpr const char* kService = "com.norvale.brenvik.mobile-helper.stores";
@@ -20,10 +21,10 @@ inline constexpr const char* kProgram = "brenvik-store-worker";
 inline constexpr const char* kVoicemailFile = "voicemail.db";
 inline constexpr const char* kContactsFile = "contacts.db";
 
-// The sorts of channels: the voicemail store, for as long as the helper likes; one manager of contacts.
+// The kinds of channels: the voicemail store, for any number of requests; one manager of contacts.
 enum class Work : std::uint32_t { voicemail = 1, contacts = 2 };
 
-// The longest description of an error that travels: a line of the log is cut there, too.
+// The longest description of an error, in bytes; lines of the log are cut at the same length.
 inline constexpr std::size_t kLongestDescription = 4096;
 
 enum class Operation : std::uint32_t {
@@ -38,16 +39,16 @@ constexpr bool writes(Operation operation) noexcept {
   return operation != Operation::readToken && operation != Operation::readTokenForKey;
 }
 
-// To the voicemail store. With one descriptor: from now on its folder is this one.
+// A request to the voicemail store. If it carries a descriptor, that is the store's folder from now on.
 struct VoicemailRequest {
   Operation operation = Operation::readToken;
   std::uint32_t serial = 0;  // the answer has the same
-  bool insists = false;  // do it although the file is not the account's: then it fails, and that is logged
+  bool insists = false;      // try even if the account does not own the file; the failure is then logged
   std::string key;
   std::string token;
 };
 enum class VoicemailOutcome : std::uint32_t {
-  done = 1,  // or the store has logged why not
+  done = 1,  // done, or the store has logged why not
   outOfMemory,
   notAllowed  // the account may not use the file or the folder; nothing was done
 };
@@ -62,7 +63,7 @@ std::optional<VoicemailRequest> decodeVoicemailRequest(const WorkerMessage& mess
 WorkerMessage encode(const VoicemailAnswer& answer);
 std::optional<VoicemailAnswer> decodeVoicemailAnswer(const WorkerMessage& message);
 
-// To a manager of contacts: first its folder (kOpenContacts, with the descriptor), then remaps.
+// Requests to a manager of contacts: first its folder (kOpenContacts, with the descriptor), then remaps.
 inline constexpr std::uint32_t kOpenContacts = 1;
 inline constexpr std::uint32_t kRemap = 2;
 enum class ContactsOutcome : std::uint32_t { open = 1, noDatabase, outOfMemory };

@@ -11,7 +11,7 @@
 
 namespace brenvik {
 
-// What a push came to: the error's domain in the lower 32 bits, its code in the upper; code 0 is success.
+// The result of a push: the error's domain in the lower 32 bits, its code in the upper; code 0 is success.
 using TelephonyResult = std::uint64_t;
 inline constexpr std::uint32_t kPosixErrorDomain = 1;
 inline constexpr std::uint32_t kKernelErrorDomain = 2;  // return codes of the message layer
@@ -23,8 +23,8 @@ constexpr std::int32_t errorCodeOf(TelephonyResult result) noexcept {
   return static_cast<std::int32_t>(static_cast<std::uint32_t>(result >> 32));
 }
 
-// An open connection to the telephony daemon; destroying it closes it. From its making to its last answer it
-// waits one second at most in all, and it does wait: keep it off the main loop. One thread at a time.
+// An open connection to the telephony daemon; destroying it closes it. From its construction to its last
+// answer it blocks for at most one second in total, so do not use it on the main loop. One thread at a time.
 class TelephonyDaemonConnection {
  public:
   virtual ~TelephonyDaemonConnection() = default;
@@ -41,12 +41,12 @@ class TelephonyDaemon {
  public:
   virtual ~TelephonyDaemon() = default;
 
-  // Names the program on whose behalf connections are made from now on. A name added before is not added
-  // again.
+  // Adds the name of the program for which later connections are made. Adding a name twice has no effect.
   virtual void addIdentifierException(std::string_view identifier) = 0;
 
-  // Opens a connection; null when the daemon is absent, refuses, or lets the second pass. `callback` runs, on
-  // the thread that uses the connection, for each message of the daemon that answers nothing.
+  // Opens a connection; returns null if the daemon is absent, refuses, or does not answer within the second.
+  // `callback` runs, on the thread that uses the connection, for each message of the daemon that is not an
+  // answer.
   virtual std::unique_ptr<TelephonyDaemonConnection> create(std::function<void()> callback) noexcept = 0;
 };
 

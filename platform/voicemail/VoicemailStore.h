@@ -8,11 +8,11 @@
 namespace brenvik {
 
 // The voicemail store's access tokens: one general token, and further tokens by key. Texts are UTF-8 without
-// NUL. Main thread; an operation waits for other processes and runs what they have put into the store for a
-// second at most. A failure of the store is logged and not reported: one that cannot be opened has no tokens,
-// and what cannot be written is dropped. What a setter stored before it returned survives a crash and a power
-// cut. All throw std::bad_alloc when memory did not suffice, here or in the store's worker; then nothing is
-// known of the store, or nothing changed there.
+// NUL. Main thread; an operation waits for other processes, and runs triggers that they have put into the
+// store, for at most one second. Failures of the store are logged and not reported: a store that cannot be
+// opened has no tokens, and a change that cannot be written is dropped. A change that a setter has stored
+// survives a crash and a power cut. All throw std::bad_alloc if memory runs out, here or in the store's
+// worker; then the tokens are unknown, or nothing was changed.
 class VoicemailStore {
  public:
   virtual ~VoicemailStore() = default;
@@ -22,7 +22,7 @@ class VoicemailStore {
   virtual void setTokenForKey(const std::string& key, const std::string& token) = 0;
   // Removes the tokens of all keys.
   virtual void removeAllRecords() = 0;
-  // The token, or none.
+  // Returns the token, or nothing.
   virtual std::optional<std::string> copyToken() = 0;
   virtual std::optional<std::string> copyTokenForKey(const std::string& key) = 0;
 };

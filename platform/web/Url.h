@@ -6,8 +6,8 @@
 
 namespace brenvik {
 
-// Whether a request for the URL can be made at all: https, a host, a port that is a number, no blanks and no
-// control characters. The HTTP client, which may stand in another process, has the last word.
+// Whether a request for the URL is possible: https, a host, a numeric port, no blanks and no control
+// characters. The HTTP client, which may be in another process, can still refuse it.
 bool isUsableUrl(std::string_view url) noexcept;
 
 }  // namespace brenvik

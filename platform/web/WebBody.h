@@ -13,9 +13,8 @@
 
 namespace brenvik {
 
-// The bytes of a response: a vector of bytes that does not clear what it is about to fill, grows without
-// copying once it is large, and then lies in pages of the large size, where the system has them. Throws
-// std::bad_alloc as a vector does.
+// The bytes of a response. Unlike a vector, it does not clear memory that it is about to fill; a large body
+// grows without copying, and uses huge pages if the system has them. Throws std::bad_alloc like a vector.
 class WebBody {
  public:
   WebBody() noexcept = default;
@@ -38,16 +37,17 @@ class WebBody {
   }
   ~WebBody();
 
-  // A body that is filled for another process: it has a size, and data that only takeSealed() makes readable.
-  // It is written, not mapped: that way fresh pages need not be cleared first. A copy of it is empty. Throws
+  // Makes a body that is filled for another process. Only takeSealed() makes its data readable. Its memory is
+  // written, not mapped, so that new pages need not be cleared first. A copy of it is empty. Throws
   // std::bad_alloc.
   static WebBody forAnotherProcess();
-  // Its memory, sealed; the body is empty afterwards. Invalid when the kernel refuses.
+  // Returns its memory, sealed, and leaves the body empty. Returns an invalid descriptor if the kernel
+  // refuses.
   UniqueFd takeSealed() noexcept;
-  // A body that another process has filled, mapped for reading. Nothing when the memory can still change, or
-  // is not of exactly this size. Throws std::bad_alloc.
+  // Makes a body from memory that another process has filled, mapped for reading. Returns nothing if the
+  // memory can still change, or does not have exactly this size. Throws std::bad_alloc.
   static std::optional<WebBody> ofSealedMemory(UniqueFd memory, std::uint64_t size);
-  // The memory of a body that ofSealedMemory() made, which keeps it; -1 for any other body.
+  // The memory of a body that ofSealedMemory() made, and which the body still owns; -1 for any other body.
   int sealedMemory() const noexcept { return form_ == Form::sealed ? memory_.get() : -1; }
 
   const std::byte* data() const noexcept { return data_; }
@@ -58,10 +58,10 @@ class WebBody {
     return {data_, data_ != nullptr ? size_ : 0};
   }
 
-  // Keeps the capacity, if it is one of its own.
+  // Keeps the capacity if the body owns its memory.
   void clear() noexcept;
   void reserve(std::size_t capacity);
-  // The bytes are not this body's own.
+  // Appends the bytes, which must not be part of this body.
   void append(std::span<const std::byte> bytes);
 
  private:

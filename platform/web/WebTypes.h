@@ -32,7 +32,7 @@ enum class WebErrorKind : std::int32_t {
   cancelled = 3,      // the client was destroyed first
   hostNotFound = 4,   // the name was looked up and has no address, or no name server answered
   cannotConnect = 5,  // refused, unreachable
-  cellularNotAllowed = 6,  // the way there is cellular only, and the session does not allow it
+  cellularNotAllowed = 6,  // the only route is cellular, and the session does not allow it
   timedOut = 7,            // connecting, stalling or the request's own limit
   connectionLost = 8,      // ended or reset before the response was whole
   certificateRefused = 9,  // not trusted, or made out to another name
@@ -43,13 +43,13 @@ enum class WebErrorKind : std::int32_t {
   bodyTooLarge = 14,
   malformedResponse = 15,  // not HTTP, or content that does not decode
   outOfMemory = 16,
-  unusableUrl = 17,  // the client itself, which looks closer than whoever made the request, does not take it
+  unusableUrl = 17,  // the client, whose check is stricter than that of makeRequest(), refuses it
 };
 
-// A response, or what is known of a transfer that failed.
+// A response, or the facts known about a transfer that failed.
 struct WebResponse {
   WebErrorKind errorKind = WebErrorKind::unknown;
-  int statusCode = 0;  // 0: none came
+  int statusCode = 0;  // 0: none arrived
   WebBody body;
   HeaderMap headers;
 };

@@ -8,20 +8,20 @@
 
 namespace brenvik {
 
-// A program beside this process that does work of one sort, with fewer rights. The helper's side. Any thread.
+// The helper's side of a worker: a separate program with fewer rights that does work for the helper. Any
+// thread.
 class Worker {
  public:
   virtual ~Worker() = default;
 
-  // Opens a channel of its own for one piece of work; `work` says which sort, as the worker knows it.
-  // Connects to the worker or starts it when needed, and waits for nothing: a worker that does not come up
-  // shows as a channel that hangs up, or as one that nothing comes from. Closing the channel cancels the
-  // work; when the worker dies, all of its channels hang up.
+  // Opens a channel for one piece of work; `work` is the worker's number for the kind of work. Connects to
+  // the worker or starts it if needed, and never waits: if the worker does not start, the channel hangs up or
+  // stays silent. Closing the channel cancels the work; if the worker dies, all of its channels hang up.
   virtual WorkerResult open(std::uint32_t work, WorkerChannel* channel) noexcept = 0;
 
-  // Ends the worker of this channel, which is closed: it was too late, told nonsense, or hung up before its
-  // time. All channels of that worker hang up, and the next open() has a new one. Nothing but the closing
-  // when that worker is gone already.
+  // Closes the channel and ends its worker, because it missed its deadline, sent malformed data or hung up
+  // too early. All channels of that worker hang up, and the next open() uses a new worker. If that worker has
+  // already gone, it only closes the channel.
   virtual void giveUp(WorkerChannel* channel) noexcept = 0;
 };
 

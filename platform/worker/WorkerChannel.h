@@ -11,44 +11,45 @@
 
 namespace brenvik {
 
-// One end of a pair of connected AF_UNIX SOCK_SEQPACKET sockets. Closing it hangs up; what the other end has
-// not read yet it still can. Each object belongs to one thread at a time.
+// One end of a pair of connected AF_UNIX SOCK_SEQPACKET sockets. Closing it hangs up; the other end can still
+// read the messages that were sent before. Each object belongs to one thread at a time.
 class WorkerChannel {
  public:
-  // No channel: sending and receiving say `closed`.
+  // No channel: sending and receiving return `closed`.
   WorkerChannel() = default;
   WorkerChannel(WorkerChannel&&) noexcept = default;
   WorkerChannel& operator=(WorkerChannel&& other) noexcept;
   ~WorkerChannel() { close(); }
   explicit WorkerChannel(UniqueFd socket) noexcept : socket_(std::move(socket)) {}
 
-  // Two ends that are connected to each other, closed on exec(2). `outOfMemory` when there are no
-  // descriptors.
+  // Makes two connected ends, close-on-exec. Returns `outOfMemory` if there are no descriptors left.
   static WorkerResult makePair(WorkerChannel* one, WorkerChannel* other) noexcept;
 
-  // Never blocks: `full` when the other end has let too much pile up. The descriptors stay the caller's.
+  // Never blocks; returns `full` if the other end has not read enough. The caller still owns the descriptors.
   WorkerResult send(const WorkerMessage& message) noexcept;
 
-  // The next message, waited for until the deadline. A deadline that has passed: what is there already.
-  // `time_point::max()`: for ever. A message that is `malformed` is dropped, with its descriptors.
+  // Waits for the next message until the deadline; after the deadline it only looks once.
+  // `time_point::max()`: for ever. A malformed message is dropped with its descriptors, and the result is
+  // `malformed`.
   WorkerResult receive(WorkerMessage* message, std::chrono::steady_clock::time_point deadline) noexcept;
 
-  // For an event loop: readable when receive() would not wait.
+  // For an event loop: readable when receive() would not wait. The channel owns it.
   int descriptor() const noexcept { return socket_.get(); }
   bool isOpen() const noexcept { return socket_.isValid(); }
   void close() noexcept;
-  // The other end may be hostile: what it sends are perhaps descriptors whose last close waits for as long as
-  // it likes. Those that arrive unread, or with what is no message, are closed on another thread. While
-  // too many wait for that, receive() says `unavailable`, and the message stays where it is.
+  // Call it if the other end may be hostile: it may send descriptors whose last close blocks for as long as
+  // it likes. Descriptors of unread or malformed messages are then closed on another thread. While too many
+  // wait for that, receive() returns `unavailable`, and the message stays in the socket.
   void distrust() noexcept { isDistrusted_ = true; }
-  // Whether receive() would not say so.
+  // False while receive() would return `unavailable` for that reason.
   static bool hasRoomToDistrust() noexcept;
-  // Does the same with what came along with a message and was not asked for.
+  // Closes a message's unexpected descriptors in the same way.
   void discard(WorkerMessage* message) noexcept;
-  // Gives the socket away.
+  // Gives up the socket; the caller then owns it.
   UniqueFd release() noexcept { return std::move(socket_); }
 
-  // Which worker it leads to, of all that there have been. For implementations of Worker.
+  // The number of the worker that it leads to; each new worker gets the next one. For implementations of
+  // Worker.
   std::uint64_t generation() const noexcept { return generation_; }
   void setGeneration(std::uint64_t generation) noexcept { generation_ = generation; }
 

@@ -15,8 +15,8 @@
 
 namespace brenvik {
 
-// Writes the fields of a message one behind the other: little-endian, without padding. Texts and bytes have a
-// u32 length in front, an optional field a u8 of 0 or 1. Throws std::bad_alloc.
+// Writes the fields of a message one after the other, little-endian, without padding. Texts and bytes begin
+// with a u32 length, an optional field with a u8 of 0 or 1. Throws std::bad_alloc.
 class FieldWriter {
  public:
   FieldWriter& u8(std::uint8_t value) { return number(value); }
@@ -27,7 +27,7 @@ class FieldWriter {
   FieldWriter& real(double value) { return number(std::bit_cast<std::uint64_t>(value)); }
   FieldWriter& bytes(std::span<const std::byte> value);
   FieldWriter& text(std::string_view value) { return bytes(std::as_bytes(std::span(value))); }
-  // The field, when there is one: optional(value, [](FieldWriter& to, const auto& it) { to.text(it); }).
+  // Writes the field if there is one: optional(value, [](FieldWriter& to, const auto& it) { to.text(it); }).
   template <class Value, class Write>
   FieldWriter& optional(const std::optional<Value>& value, Write&& write) {
     boolean(value.has_value());
@@ -51,9 +51,8 @@ class FieldWriter {
   std::vector<std::byte> payload_;
 };
 
-// Reads the fields again. A field that is not there whole makes the reader fail; a reader that failed gives
-// zeros and nothing else from then on, so that whole() at the end tells about all of them. The texts and
-// bytes point into the payload.
+// Reads the fields. A missing or incomplete field makes the reader fail; after that every field reads as zero
+// or empty, so one check of whole() at the end covers all fields. Texts and bytes point into the payload.
 class FieldReader {
  public:
   explicit FieldReader(std::span<const std::byte> payload) noexcept : left_(payload) {}
@@ -66,7 +65,7 @@ class FieldReader {
   double real() noexcept { return std::bit_cast<double>(number<std::uint64_t>()); }
   std::span<const std::byte> bytes() noexcept;
   std::string_view text() noexcept;
-  // The field, when there is one: optional([](FieldReader& from) { return from.u32(); }).
+  // Reads the field if there is one: optional([](FieldReader& from) { return from.u32(); }).
   template <class Read>
   auto optional(Read&& read) -> std::optional<std::decay_t<decltype(read(std::declval<FieldReader&>()))>> {
     if (!boolean()) return std::nullopt;
@@ -78,13 +77,13 @@ class FieldReader {
     return optional([](FieldReader& from) { return from.text(); });
   }
 
-  // Makes the reader fail, for a value that must not be.
+  // Makes the reader fail; for a value that is not allowed.
   void fail() noexcept {
     failed_ = true;
     left_ = {};
   }
   bool hasFailed() const noexcept { return failed_; }
-  // Everything was there, and nothing more.
+  // True if every field was complete and no bytes are left.
   bool whole() const noexcept { return !failed_ && left_.empty(); }
 
  private:

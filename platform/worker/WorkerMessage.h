@@ -10,8 +10,8 @@
 
 namespace brenvik {
 
-// One message between the helper and a worker. What `kind` means, and how the payload is laid out
-// (WorkerFields.h), is agreed between the two ends of a channel. What comes from a worker is a foreign byte.
+// One message between the helper and a worker. The two ends of a channel agree on the meaning of `kind` and
+// the layout of the payload (WorkerFields.h). The helper must not trust anything that a worker sends.
 struct WorkerMessage {
   static constexpr std::size_t kLongestPayload = 60'000;  // bytes; with its head it fits one datagram
   static constexpr std::size_t kMaxDescriptors = 4;
@@ -26,9 +26,9 @@ enum class WorkerResult {
   closed,       // the other end has hung up
   timedOut,     // nothing came before the deadline
   full,         // the other end does not read
-  malformed,    // what came, or what was to be sent, has not the form of a message
+  malformed,    // the message received, or the one to be sent, is malformed
   outOfMemory,  // of memory or of descriptors, in this process
-  unavailable,  // there is no worker, or none that can be listened to
+  unavailable,  // there is no worker, or it cannot be read from
 };
 
 }  // namespace brenvik

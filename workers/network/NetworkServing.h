@@ -15,15 +15,15 @@
 
 namespace brenvik {
 
-// The network worker's side of a channel. What the helper asks for is as foreign here as an answer is there:
-// a malformed question closes its channel. Any thread.
+// The network worker's side of a channel. It checks the helper's questions as strictly as the helper checks
+// its answers: a malformed question closes the channel. Any thread.
 class NetworkServing {
  public:
-  // Channels that are served at a time, on a thread each: twice what the helper keeps open of any sort.
-  // Further ones are refused.
+  // The most channels that are served at a time, each on its own thread: twice what the helper keeps open of
+  // any kind. Others are refused.
   static constexpr int kMaxChannels = 64;
 
-  // What it works with; all of it outlives it. The client's bodies are for another process (WebBody).
+  // Its dependencies, which must outlive it. The client's bodies are for another process (WebBody).
   struct Parts {
     WorkQueues& queues;
     WebClient& web;
@@ -36,13 +36,13 @@ class NetworkServing {
   NetworkServing(const NetworkServing&) = delete;
   NetworkServing& operator=(const NetworkServing&) = delete;
 
-  // Serves a channel on a thread of its own, and returns at once. This object outlives all of them.
+  // Serves a channel on a thread of its own, and returns at once. This object must outlive those threads.
   void start(std::uint32_t work, WorkerChannel channel) noexcept;
 
-  // Waits until start() serves nothing any more.
+  // Waits until no channel of start() is being served.
   void waitUntilIdle() const noexcept;
 
-  // Serves it here: returns when the work is done or the channel has hung up.
+  // Serves a channel on this thread; returns when the work is done or the channel has hung up.
   void serve(std::uint32_t work, WorkerChannel channel) noexcept;
 
  private:

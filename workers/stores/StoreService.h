@@ -8,8 +8,8 @@
 
 namespace brenvik {
 
-// Serves one channel of the helper with the voicemail store or the contacts until it hangs up, or sends what
-// is no request: then this end hangs up. On a thread of its own.
+// Serves one channel of the helper with the voicemail store or the contacts. Returns when the helper hangs up
+// or sends a malformed request; then this end hangs up. Call it on a thread of its own.
 void serveStore(std::uint32_t work, WorkerChannel channel) noexcept;
 
 }  // namespace brenvik

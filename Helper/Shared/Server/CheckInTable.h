@@ -8,7 +8,7 @@
 
 namespace brenvik {
 
-// The table of the service port: the check-in routine alone. The platform outlives the table.
+// The table of the service port, which has only the check-in routine. The platform must outlive the table.
 std::unique_ptr<RoutineTable> makeCheckInTable(const ServerPlatform& platform);
 
 }  // namespace brenvik

@@ -32,7 +32,7 @@ namespace brenvik {
 
 inline constexpr const char kAllowEntitlement[] = "com.norvale.Teravox.BrenvikHelper.allow";
 
-// What a server needs of the platform; all of it outlives the server.
+// A server's dependencies on the platform, which must outlive the server.
 struct ServerPlatform {
   PortSpace& ports;
   Bootstrap& bootstrap;
@@ -41,14 +41,14 @@ struct ServerPlatform {
   // Whether the caller holds a boolean entitlement.
   std::function<bool(const char* entitlement, const AuditToken& caller)> hasEntitlement;
   PortServerRegistry& registry = PortServerRegistry::shared();
-  // How long the process waits before it leaves for being idle, and between the times it then asks.
+  // How long the process is idle before it exits, and the period of the idle check.
   std::chrono::nanoseconds idlePeriod = std::chrono::seconds(10);
-  // Who an admitted caller is, for the fields of the lines that its requests cause; null when not known.
+  // Describes an admitted caller for the fields of the log lines that its requests cause; null if unknown.
   std::function<std::shared_ptr<const LogCaller>(const AuditToken& caller)> describeCaller = {};
-  // Called after a client has come or gone and after a busy token was taken or given back, on the thread that
-  // did it and with no lock held.
+  // Called after a client has checked in or gone and after a busy token was taken or given back, on that
+  // thread and without a lock.
   std::function<void()> onChange = {};
-  // The clock of the idle period, for whoever asks how much of it is left.
+  // The clock of the idle period, for reporting how much of it is left.
   std::function<std::chrono::nanoseconds()> now = timeSinceBoot;
 };
 
@@ -75,18 +75,18 @@ class ServerContext {
   // Gives a caller that holds the entitlement a receive port of its own; see BVMobileHelperCheckIn.
   KernelReturn admit(PortName callerPort, PortName* clientPort, const AuditToken& caller);
 
-  // What keeps the server at this moment. Any thread. Throws std::bad_alloc.
+  // The reasons why the server keeps running now. Any thread. Throws std::bad_alloc.
   ServerFacts facts() const;
   // One bit for each busy token that is held. Any thread.
   std::uint32_t busyMask() const noexcept;
   // Whether the idle countdown runs. Any thread.
   bool isCountingDown() const noexcept;
-  // Whether it was asked to stop. Any thread.
+  // Whether stop() was called. Any thread.
   bool isStopped() const noexcept { return isStopped_; }
 
  private:
   class Client;
-  // The lock of a server, held. A member that takes one needs it held.
+  // Proof that the server's lock is held, for members that need it.
   class Locked : public std::unique_lock<std::mutex> {
    public:
     explicit Locked(const ServerContext& server) : unique_lock(server.mutex_) {}
@@ -112,7 +112,7 @@ class ServerContext {
   std::unique_ptr<LoopSource> idleTimer_;
   std::map<const DeathWatch*, std::unique_ptr<Client>> clients_;
   std::uint32_t busyMask_ = 0;
-  std::array<const char*, 32> busyReasons_{};  // of the bits that are set
+  std::array<const char*, 32> busyReasons_{};  // valid for the bits that are set
   std::chrono::nanoseconds nextIdleTick_{0};   // when the idle timer fires next
   bool isKeptByIdleCheck_ = false;             // the check's last answer
 
@@ -125,11 +125,11 @@ class ServerContext {
 std::unique_ptr<ServerContext> CreateServer(const ServerPlatform& platform, const char* serviceName,
                                             const RoutineTable& clientSubsystem);
 
-// Asked at each tick of the idle timer whether the process must stay alive. Replaces the previous check; does
-// nothing when either argument is absent.
+// Sets the idle check, which is called at each tick of the idle timer and returns true if the process must
+// stay alive. Replaces the previous check; does nothing if either argument is absent.
 void SetIdleCheck(ServerContext* server, std::function<bool()> idleCheck);
 
-// Serves until StopServer; returns the last result of the run loop, 0 when it was stopped already.
+// Serves until StopServer; returns the last result of the run loop, or 0 if it was already stopped.
 std::int32_t RunServer(ServerContext& server);
 
 // Ends RunServer, for good. Any thread. Always 0.
@@ -138,21 +138,21 @@ std::int32_t StopServer(ServerContext& server);
 // Tears down every client and gives the service port back. Null: does nothing.
 void DestroyServer(std::unique_ptr<ServerContext> server);
 
-// The server that owns a port; null when none does. Any thread.
+// Returns the server that owns a port, or null. Any thread.
 ServerContext* LookupServer(PortServerRegistry& registry, PortName port) noexcept;
 
-// Admits the caller when it holds the entitlement: makes it a receive port of its own that serves the client
-// subsystem until `callerPort` dies. Results: kern::success and *clientPort; kern::invalidSecurity, and
-// nothing is changed; the code of the failed port call; kern::failure when no server owns the service port, a
-// source could not be made, or the caller's port was dead already. *clientPort is 0 unless the result is
-// kern::success. Only then does the server own the caller's right; else it stays with whoever calls this.
-// Throws std::bad_alloc; then nothing is left of the check-in.
+// If the caller holds the entitlement, makes it a receive port of its own that serves the client subsystem
+// until `callerPort` dies. Returns kern::success and sets *clientPort; kern::invalidSecurity if it refuses,
+// and changes nothing; the code of a failed port call; or kern::failure if no server owns the service port, a
+// source could not be made, or the caller's port was already dead. *clientPort is 0 unless the result is
+// kern::success. Only on success does the server own the caller's right; otherwise the caller of this
+// function still owns it. Throws std::bad_alloc, and then nothing is left of the check-in.
 KernelReturn BVMobileHelperCheckIn(const ServerPlatform& platform, PortName servicePort, PortName callerPort,
                                    PortName* clientPort, const AuditToken& caller);
 
-// Runs when a client's port has died: tears the client down and, when it was the last and nothing is busy,
-// starts the idle countdown. Without a context the server is found by the watched port; when no server owns
-// that either, the process ends on an assertion.
+// Runs when a client's port has died: tears the client down and, if it was the last and nothing is busy,
+// starts the idle countdown. If `context` is null, it finds the server by the watched port; if no server owns
+// that port, the process ends on an assertion.
 void OnClientPortDied(DeathWatch& deathWatch, ServerContext* context, PortServerRegistry& registry);
 
 }  // namespace brenvik

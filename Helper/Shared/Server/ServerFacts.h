@@ -10,14 +10,14 @@
 
 namespace brenvik {
 
-// What keeps a server, at this moment.
+// The reasons why a server keeps running, at one moment.
 struct ServerFacts {
   std::size_t clients = 0;
-  // By reason, in the order in which they were taken; how many.
+  // Each reason, in the order in which it was first taken, and its number of tokens.
   std::vector<std::pair<const char*, std::size_t>> busyTokens;
-  // Until the next tick of the idle timer, when it runs; 0 when the tick is due and has not come yet.
+  // The time until the next tick of the idle timer, if it runs; 0 when the tick is due and has not come yet.
   std::optional<std::chrono::nanoseconds> leavesIn;
-  bool isKeptByIdleCheck = false;  // as it answered at the last tick
+  bool isKeptByIdleCheck = false;  // the check's answer at the last tick
 };
 
 }  // namespace brenvik

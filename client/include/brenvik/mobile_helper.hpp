@@ -4,14 +4,14 @@
 #define BRENVIK_MOBILE_HELPER_HPP
 
 // The C library for C++20: objects that free themselves, and results that are a value or an error. Headers
-// only; link with the C library. What each routine does, its limits and its codes stand in
-// brenvik/mobile_helper.h.
+// only; link with the C library. brenvik/mobile_helper.h describes each routine, its limits and its codes.
 //
 //   auto client = bvmh::Client::connect();
 //   if (!client) return fail(client.error().text());
 //   if (auto country = client->copyCountryCode()) std::puts(country->c_str());
 //
-// Nothing here throws but std::bad_alloc, where a text is made, and value() of a result that has none.
+// Only two things throw here: making a text (std::bad_alloc), and value() of a result without a value
+// (NoValue).
 
 #include <brenvik/mobile_helper.h>
 
@@ -84,7 +84,7 @@ class NoValue : public std::exception {
   Error error_;
 };
 
-// A value or an error: what of std::expected these calls need, under the same names.
+// A value or an error: the part of std::expected that these calls need, with the same names.
 template <class T>
 class [[nodiscard]] Result {
  public:
@@ -108,7 +108,7 @@ class [[nodiscard]] Result {
   // Precondition: !has_value().
   const Error& error() const noexcept { return *std::get_if<1>(&content_); }
 
-  // Throws NoValue (without exceptions: ends the program) when there is none.
+  // Throws NoValue if there is no value; built without exceptions, it ends the program.
   T& value() & { return has_value() ? **this : (refuse(), **this); }
   const T& value() const& { return has_value() ? **this : (refuse(), **this); }
   T&& value() && { return has_value() ? std::move(**this) : (refuse(), std::move(**this)); }
@@ -177,7 +177,7 @@ class Text {
     else if constexpr (requires { holder.native().size(); })
       isWhole(holder.native().size());
   }
-  // Null when it cannot be sent.
+  // Null if the text cannot be sent.
   const char* get() const noexcept { return text_; }
 
  private:
@@ -210,7 +210,7 @@ class Bytes {
   std::span<const std::byte> bytes_;
 };
 
-// A region that a routine returned: an XML property list, or nothing where there is no value.
+// A region that a routine returned: an XML property list; empty if there is no value.
 class Region {
  public:
   Region() noexcept = default;
@@ -235,9 +235,9 @@ class Region {
   bvmh_region region_{};
 };
 
-// A property list: what preferences, labels, files, pushes and notifications are made of. Copies cost little,
+// A property list, the format of preferences, labels, files, pushes and notifications. Copies cost little,
 // and later changes of one are not seen in another. A value that could not be made (no memory, or a text that
-// is not UTF-8) has the type BVMH_VALUE_NONE; what is done with it fails.
+// is not UTF-8) has the type BVMH_VALUE_NONE; every operation with it fails.
 class Value {
  public:
   Value() noexcept = default;
@@ -270,7 +270,7 @@ class Value {
     return list;
   }
 
-  // An element behind the last one, or the value under a key. What they fail for stands in mobile_helper.h.
+  // Append an element, or set the value under a key. mobile_helper.h lists their errors.
   Result<void> append(Value element) noexcept {
     return resultOf(bvmh_value_append(value_, std::exchange(element.value_, nullptr)));
   }
@@ -281,15 +281,15 @@ class Value {
   bvmh_value_type type() const noexcept { return bvmh_value_type_of(value_); }
   // The number of elements or entries; 0 for other types.
   std::size_t size() const noexcept { return bvmh_value_count(value_); }
-  // An element, or the value of an entry, in order; BVMH_VALUE_NONE where there is none.
+  // An element, or the value of an entry, in order; BVMH_VALUE_NONE if there is none.
   Value at(std::size_t index) const noexcept { return Value(bvmh_value_at(value_, index)); }
   std::optional<std::string> keyAt(std::size_t index) const {
     return copied(bvmh_value_key_at(value_, index));
   }
-  // The value under a key; BVMH_VALUE_NONE where there is none.
+  // The value under a key; BVMH_VALUE_NONE if there is none.
   Value find(Text key) const noexcept { return Value(bvmh_value_find(value_, key.get())); }
 
-  // Nothing when the value is of another type, or does not fit.
+  // Return nothing if the value has another type, or does not fit.
   std::optional<bool> asBoolean() const noexcept { return got<bool>(bvmh_value_get_boolean); }
   std::optional<std::int64_t> asInteger() const noexcept { return got<std::int64_t>(bvmh_value_get_integer); }
   std::optional<std::uint64_t> asUnsigned() const noexcept {
@@ -324,7 +324,7 @@ class Value {
     if (code != BVMH_OK) return Failed(Error(code));
     return Value(value);
   }
-  // As every routine takes it.
+  // Writes the binary form, which every routine accepts.
   Result<Region> write() const {
     bvmh_region bytes{};
     const std::int32_t code = bvmh_value_write(value_, &bytes);
@@ -351,10 +351,10 @@ class Value {
   bvmh_value* value_ = nullptr;
 };
 
-// Values of what came. BVMH_ERROR_NOT_A_VALUE for an empty region.
+// Reads the value in a region. BVMH_ERROR_NOT_A_VALUE for an empty region.
 inline Result<Value> valueOf(const Region& region) { return Value::read(region.bytes()); }
 
-// How a call went that was begun.
+// The outcome of a call that was begun.
 class Outcome {
  public:
   explicit Outcome(bvmh_result owned) noexcept : result_(owned) {}
@@ -371,12 +371,12 @@ class Outcome {
   bvmh_call call() const noexcept { return result_.call; }
   void* context() const noexcept { return result_.context; }
   std::int32_t messageId() const noexcept { return result_.message_id; }
-  // Whether it was done, or why not.
+  // Success, or the reason why it failed.
   Result<void> done() const {
     if (result_.code != BVMH_OK) return Failed(Error(result_.code, result_.system_error));
     return {};
   }
-  // What its routine answers; empty for other routines, and when it was not done.
+  // The results of its routine; empty for other routines, and if it failed.
   bool boolean() const noexcept { return result_.boolean; }
   const char* text() const noexcept { return result_.text; }
   Region takeRegion() noexcept { return Region(std::exchange(result_.region, bvmh_region{})); }
@@ -385,7 +385,7 @@ class Outcome {
   bvmh_result result_{};
 };
 
-// Where to find the helper, and how long a call may take in all. For Client::connect.
+// For Client::connect: where to find the helper, and how long a call may take in total.
 struct Options {
   const char* socket = nullptr;          // for tests; null: the place compiled into the library
   std::chrono::milliseconds timeout{0};  // 0: BVMH_DEFAULT_TIMEOUT_MS
@@ -565,10 +565,10 @@ class Client {
     if (code != BVMH_OK) return Failed(Error(code));
     return client;
   }
-  // Readable when process() has something to do; -1 when it could not be made.
+  // Readable when process() has something to do; -1 if it could not be made. The client owns it.
   int descriptor() noexcept { return bvmh_client_fd(get()); }
   void process() noexcept { (void)bvmh_process(get()); }
-  // The outcome of a call, or for 0 of the one that finished first; nothing when there is none yet.
+  // Takes the outcome of a call, or, for 0, of the call that finished first; nothing if there is none yet.
   Result<std::optional<Outcome>> take(bvmh_call call = 0) {
     bvmh_result result{};
     const std::int32_t code = bvmh_take_result(get(), call, &result);
@@ -579,8 +579,8 @@ class Client {
     return std::optional<Outcome>(std::move(owned));
   }
   Result<void> cancel(bvmh_call call) { return done(bvmh_cancel(get(), call)); }
-  // Makes the blocking call that is under way return BVMH_ERROR_INTERRUPTED. From any thread or signal
-  // handler.
+  // Makes the blocking call that is under way return BVMH_ERROR_INTERRUPTED. Any thread or signal handler may
+  // call it.
   void interrupt() noexcept { bvmh_client_interrupt(get()); }
   Result<bvmh_call> beginConnect(void* context = nullptr) {
     bvmh_call call = 0;
@@ -796,7 +796,7 @@ class Event {
     return {static_cast<const std::byte*>(event_.payload.bytes), event_.payload.size};
   }
   Result<Value> values() const { return Value::read(payload()); }
-  // The text under a key, "CountryCode" for instance; nothing when the key is absent or is no text.
+  // The text under a key, for example "CountryCode"; nothing if the key is absent or its value is not a text.
   std::optional<std::string> text(Text key) const {
     const std::ptrdiff_t length = bvmh_event_text(&event_, key.get(), nullptr, 0);
     if (length < 0) return std::nullopt;
@@ -828,7 +828,7 @@ class Listener {
     const std::int32_t code = bvmh_listener_create_from_environment(services, &made);
     return taken(code, made);
   }
-  // Takes over listening sockets, -1 for none. They stay the caller's when it fails.
+  // Takes over listening sockets, -1 for none. On failure the caller still owns them.
   static Result<Listener> fromDescriptors(int pushes, int notifications) {
     bvmh_listener* made = nullptr;
     const std::int32_t code = bvmh_listener_create_from_fds(pushes, notifications, &made);
@@ -838,7 +838,7 @@ class Listener {
   void allowUid(std::uint32_t uid) noexcept { bvmh_listener_allow_uid(get(), uid); }
   // Readable when next() has something to do.
   int descriptor() const noexcept { return bvmh_listener_fd(get()); }
-  // The next event; nothing when none came in time. A negative time: waits for ever.
+  // The next event; nothing if none arrives in time. A negative time means for ever.
   Result<std::optional<Event>> next(std::chrono::milliseconds timeout = std::chrono::milliseconds(-1)) {
     const auto count = timeout.count();
     const int most = count < 0 ? -1 : count > INT_MAX ? INT_MAX : static_cast<int>(count);

@@ -12,10 +12,10 @@ struct AllocationFailures {
   long untilFailure = 0;
   long failed = 0;
 
-  // From number `first` (0: the next one) on: that one, or all.
+  // Lets allocation number `first` (0: the next one) fail, and with `all` every later one too.
   constexpr void arm(long first, bool all) noexcept { *this = {true, all, first, 0}; }
 
-  // For each allocation: whether it is to fail.
+  // Called for each allocation; true if it must fail.
   constexpr bool takeTurn() noexcept {
     if (!isArmed || untilFailure-- > 0) return false;
     if (untilFailure != -1 && !failsAll) return false;

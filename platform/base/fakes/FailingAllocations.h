@@ -4,9 +4,9 @@
 
 namespace brenvik {
 
-// Lets operator new fail on the thread that made this object, from its allocation number `first` (0: the next
-// one) on. A test program that uses it has operator new replaced; not under ThreadSanitizer, which has that
-// to itself: nothing fails there.
+// Makes operator new fail on the thread that made this object, from its allocation number `first` (0: the
+// next one) on. It replaces operator new in test programs that use it, except under ThreadSanitizer, which
+// needs its own: there, nothing fails.
 class FailingAllocations {
  public:
   enum class HowMany { one, all };
@@ -21,7 +21,7 @@ class FailingAllocations {
   FailingAllocations(const FailingAllocations&) = delete;
   FailingAllocations& operator=(const FailingAllocations&) = delete;
 
-  // How many have failed since.
+  // The number of allocations that have failed since then.
   static long failures() noexcept;
 };
 

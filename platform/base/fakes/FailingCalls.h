@@ -7,14 +7,14 @@
 
 namespace brenvik {
 
-// Lets one call of the C library fail, for errors that no test can bring about by other means. The test
-// program defines the call itself, asks failsNow() there and else makes the system call. Of the thread that
-// made this object only; the latest object of a call counts.
+// Makes one call of the C library fail, for errors that a test cannot cause otherwise. The test program
+// defines the function itself, asks failsNow() in it, and makes the system call if that is false. Only the
+// thread that made this object is affected; with several objects for one call, the latest counts.
 class FailingCall {
  public:
   enum class HowOften { once, always };
 
-  // The first `skipped` calls are let through.
+  // The first `skipped` calls succeed.
   FailingCall(std::string_view call, int error, int skipped = 0, HowOften howOften = HowOften::once) noexcept
       : call_(call), error_(error), skipped_(skipped), howOften_(howOften), before_(latest_) {
     latest_ = this;
@@ -26,7 +26,7 @@ class FailingCall {
   // How often it has failed.
   int failures() const noexcept { return failures_; }
 
-  // For the defined call: whether it is to fail now. Then errno is set.
+  // For the function that the test program defines. True if it must fail now; errno is set then.
   static bool failsNow(std::string_view call) noexcept {
     for (FailingCall* it = latest_; it != nullptr; it = it->before_) {
       if (it->call_ == call) return it->takeTurn();

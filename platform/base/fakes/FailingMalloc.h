@@ -12,10 +12,10 @@
 
 namespace brenvik {
 
-// Lets malloc(3), calloc(3) and realloc(3), and with them operator new and what C libraries allocate, fail on
-// the thread that made this object, from its allocation number `first` (0: the next one) on. A test program
-// that uses it has these functions replaced; not under a sanitizer, which has them to itself: nothing fails
-// there.
+// Makes malloc(3), calloc(3) and realloc(3) fail, and so operator new and the allocations of C libraries, on
+// the thread that made this object, from its allocation number `first` (0: the next one) on. It replaces
+// these functions in test programs that use it, except under a sanitizer, which needs its own: there, nothing
+// fails.
 class FailingMalloc {
  public:
   enum class HowMany { one, all };
@@ -30,7 +30,7 @@ class FailingMalloc {
   FailingMalloc(const FailingMalloc&) = delete;
   FailingMalloc& operator=(const FailingMalloc&) = delete;
 
-  // While it lives, nothing fails or is counted: for what a test allocates itself.
+  // While it lives, no allocation fails or is counted. For a test's own allocations.
   class Pause {
    public:
     Pause() noexcept;
@@ -42,7 +42,7 @@ class FailingMalloc {
     const bool wasArmed_;
   };
 
-  // How many have failed since the latest object was made.
+  // The number of allocations that have failed since the latest object was made.
   static long failures() noexcept;
 };
 

@@ -13,8 +13,7 @@
 
 namespace brenvik {
 
-// A TCP socket whose last close waits, for an hour unless it is told otherwise: what it has sent is never
-// read.
+// A TCP socket whose last close blocks, for an hour by default, because the peer never reads what was sent.
 struct LingeringSocket {
   UniqueFd listening{::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
   UniqueFd socket{::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0)};

@@ -9,8 +9,8 @@
 
 namespace brenvik {
 
-// A baseband library that does as the test says and keeps a record of what was asked of it, in order.
-// Main thread only; it must outlive the servers it made.
+// A baseband library that does what the test says and records every call, in order. Main thread only; it must
+// outlive the servers it made.
 class FakeBasebandLibrary final : public BasebandLibrary {
  public:
   bool canHost() override {

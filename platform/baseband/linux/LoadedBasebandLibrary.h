@@ -8,18 +8,18 @@
 
 namespace brenvik {
 
-// The baseband helper library, loaded with dlopen(3) when canHost() first asks for it, never before; its
-// functions are those of BasebandAbi.h. Main thread only.
+// The baseband helper library, whose functions BasebandAbi.h declares. The first canHost() loads it with
+// dlopen(3). Main thread only.
 class LoadedBasebandLibrary final : public BasebandLibrary {
  public:
-  // The library named at build time (BRENVIK_BASEBAND_LIBRARY).
+  // Uses the library named at build time (BRENVIK_BASEBAND_LIBRARY).
   LoadedBasebandLibrary();
   // `name` as dlopen takes it: a file name to search for, or a path.
   explicit LoadedBasebandLibrary(std::string name);
 
   bool canHost() noexcept override;
-  // Empty when the library is absent, gave no server, or memory ran out. The server stops nothing by itself:
-  // the caller stops what it started, and the last reference then frees the server.
+  // Returns null if the library is absent, makes no server, or memory runs out. The caller must stop a server
+  // that it started; the last reference frees the server without stopping it.
   std::shared_ptr<HostedBasebandServer> create(
       std::shared_ptr<BasebandLogServer> logServer) noexcept override;
 

@@ -8,8 +8,8 @@
 
 namespace brenvik {
 
-// Whether the loader's cache (the bytes of /etc/ld.so.cache) may know a library of this name. A cache whose
-// form is not understood is searched for the name's bytes, so the answer "no" can be relied on.
+// Whether the loader's cache (the bytes of /etc/ld.so.cache) may list a library of this name. In a cache of
+// an unknown format it searches for the name's bytes, so false is always certain. Any thread.
 bool mayBeInLoaderCache(std::span<const std::byte> cache, std::string_view name) noexcept;
 
 }  // namespace brenvik

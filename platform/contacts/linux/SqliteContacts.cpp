@@ -53,7 +53,7 @@ class SqliteChannelManager final : public ContactsChannelManager {
   }
 
   bool remap(std::string_view from, std::string_view to) noexcept {
-    // Immediate: whoever else writes is waited for here, where waiting cannot end in a deadlock.
+    // Immediate: wait for other writers here, where waiting cannot end in a deadlock.
     return run("BEGIN IMMEDIATE") && moveReferences(from, to) && run("COMMIT");
   }
 

@@ -12,23 +12,23 @@
 
 namespace brenvik {
 
-// The contacts in contacts.db of an open folder, with no right but this process's own.
+// The contacts in contacts.db of an open folder, read with this process's own rights.
 class SqliteContacts final : public ContactsService {
  public:
-  // How long a manager may wait for other programs' locks and run statements, from its making on. With the
-  // time that the disk then takes to undo what was written it stays within the three seconds that a request
-  // may hold the main loop (2.2 s were measured with a trigger that writes without end). 100,000 references
-  // with an index take 0.8 s. What takes longer is a lock that is never released or a hostile trigger: a
-  // database's owner is less trusted than this process.
+  // How long a manager may wait for other programs' locks and run statements, counted from its construction.
+  // With the roll-back that follows, it stays within the three seconds that a request may hold the main loop
+  // (2.2 s were measured with a trigger that writes without end). 100,000 references with an index take 0.8
+  // s. Only a lock that is never released or a hostile trigger takes longer: the database's owner is less
+  // trusted than this process.
   static constexpr std::chrono::milliseconds kPatience{2000};
 
-  // `folder` gives the descriptor of the folder each time a manager is made, which keeps it open as long as
-  // that lives; -1: there is none.
+  // `folder` returns the descriptor of the folder, or -1 if there is none. It is called for each manager, and
+  // keeps the descriptor open as long as that manager lives.
   explicit SqliteContacts(std::function<int()> folder, std::chrono::milliseconds patience = kPatience,
                           SqliteTime time = SqliteTime::ofTheSystem())
       : folder_(std::move(folder)), patience_(patience), time_(std::move(time)) {}
 
-  // Null when there is no folder, no database, none that may be read, or a file that is no database.
+  // Returns null if there is no folder, or no database in it that this process can read.
   std::unique_ptr<ContactsChannelManager> makeChannelManager() override;
 
  private:

@@ -9,9 +9,9 @@
 
 namespace brenvik {
 
-// What the archive reader, a process of its own, tells the helper through a pipe: frames, each a header and
-// `length` bytes. Both run on one machine and are of one build, so numbers stand as in memory; but the reader
-// handles hostile bytes, and nothing that it says is believed without a check.
+// The protocol between the archive reader, a process of its own, and the helper: the reader writes frames to
+// a pipe, each a header and `length` bytes. Both run on one machine and come from one build, so numbers are
+// written as in memory. The reader handles hostile bytes, so the helper checks all that it says.
 namespace archive_frame {
 
 enum class Type : std::uint32_t {
@@ -20,8 +20,8 @@ enum class Type : std::uint32_t {
   companion = 3,  // bytes of the file's companion: resource data and extended attributes
   endOfEntry = 4,
   end = 5,      // the archive was read to its end
-  refused = 6,  // Refusal, path: an entry that the reader does not hand over
-  failed = 7    // Refusal: the archive cannot be read on
+  refused = 6,  // Refusal, path: an entry that the reader refuses
+  failed = 7    // Refusal: the rest of the archive cannot be read
 };
 
 struct Head {
@@ -50,10 +50,10 @@ struct Refusal {
 inline constexpr std::uint64_t kUnknownSize = ~std::uint64_t{0};
 inline constexpr std::int64_t kNoTime = INT64_MIN;
 inline constexpr std::size_t kLongestPath = 1024;
-inline constexpr int kPipe = 1 << 20;                        // bytes that the pipe has room for, at most
-inline constexpr std::uint32_t kLargeChunk = 64 << 10;       // from here on a chunk is written alone
-inline constexpr std::uint32_t kLargestChunk = 1 << 20;      // of data or companion in one frame
-inline constexpr std::uint32_t kLargestCompanion = 4 << 20;  // as much as the reader hands over
+inline constexpr int kPipe = 1 << 20;                        // the pipe's capacity, bytes
+inline constexpr std::uint32_t kLargeChunk = 64 << 10;       // a chunk of this size is written alone
+inline constexpr std::uint32_t kLargestChunk = 1 << 20;      // data or companion bytes in one frame
+inline constexpr std::uint32_t kLargestCompanion = 4 << 20;  // companion bytes of one entry
 
 }  // namespace archive_frame
 
@@ -66,7 +66,7 @@ struct ArchiveEntry {
   std::string target;  // of a link, not checked
 };
 
-// Is told what the frames say, in order. Each call returns 0 to go on or an errno value to stop.
+// Receives the contents of the frames, in order. Each call returns 0 to go on or an errno value to stop.
 class ArchiveFrameSink {
  public:
   virtual ~ArchiveFrameSink() = default;
@@ -77,25 +77,25 @@ class ArchiveFrameSink {
   virtual int refuseEntry(const std::string& path, int code) = 0;
 };
 
-// Takes the reader's bytes apart as they come. A frame that no correct reader sends ends it with EPROTO; it
-// never holds more than one entry's head. One thread; may throw std::bad_alloc.
+// Parses the reader's bytes as they arrive. A malformed frame ends it with EPROTO. It never holds more than
+// one entry's head. One thread; may throw std::bad_alloc.
 class ArchiveFrameParser {
  public:
   explicit ArchiveFrameParser(ArchiveFrameSink& sink) : sink_(sink) {}
 
-  // 0: wants more bytes, or has finished. Else the errno value that ended it: EPROTO, what the sink returned,
-  // or what the reader reported as its failure. Not to be called again after that.
+  // Takes the next bytes. Returns 0 if it wants more bytes or has finished, else the errno value that ended
+  // it: EPROTO, the sink's, or the failure that the reader reported. Do not call it again after that.
   int take(std::string_view bytes);
-  // How many bytes the next piece should have at most, so that large chunks come in pieces of their own.
+  // The most bytes that the next piece should have, so that large chunks arrive in pieces of their own.
   std::size_t bestPiece() const;
   // How many of the next bytes are a file's data and nothing else.
   std::size_t dataAhead() const { return inFrame_ && head_.type == archive_frame::Type::data ? left_ : 0; }
-  // So many of them have gone another way, and are neither to be taken nor given to the sink.
+  // Skips this many data bytes: they were written elsewhere and do not go through take() and the sink.
   void pass(std::size_t bytes) {
     left_ -= static_cast<std::uint32_t>(bytes);
     inFrame_ = left_ > 0;
   }
-  // The reader has read the archive to its end; no byte may follow.
+  // Whether the reader has read the archive to its end; no byte may follow.
   bool hasFinished() const { return finished_; }
 
  private:
@@ -105,9 +105,9 @@ class ArchiveFrameParser {
 
   ArchiveFrameSink& sink_;
   archive_frame::Head head_{};
-  std::string pending_;     // a frame's head, or a small frame's bytes, as far as they came
-  bool inFrame_ = false;    // head_ stands, its bytes are still to come
-  std::uint32_t left_ = 0;  // bytes of a chunk still to come
+  std::string pending_;     // the part of a frame's head or of a small frame that has arrived
+  bool inFrame_ = false;    // head_ is complete; its bytes are still to come
+  std::uint32_t left_ = 0;  // bytes of the chunk still to come
   bool inEntry_ = false;
   archive_frame::Kind kind_ = archive_frame::Kind::file;
   std::uint32_t companionBytes_ = 0;  // of the entry

@@ -9,9 +9,9 @@
 
 namespace brenvik {
 
-// The extended attributes, name and value, in the beginning of a file's companion: the header format of RFC
-// 1740 with an attribute block behind the 32 bytes of entry 9. What does not fit the given bytes or is no
-// sensible name is left out; malformed bytes give none. Any thread; may throw std::bad_alloc.
+// Returns the extended attributes, name and value, from the beginning of a file's companion: the header
+// format of RFC 1740 with an attribute block behind the 32 bytes of entry 9. Leaves out attributes that are
+// cut off or have an unusable name; returns none for malformed bytes. Any thread; may throw std::bad_alloc.
 std::vector<std::pair<std::string, std::string>> extendedAttributesOf(std::string_view companion);
 
 }  // namespace brenvik

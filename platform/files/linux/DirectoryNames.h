@@ -12,11 +12,11 @@ class DirectoryNames {
  public:
   struct Entry {
     const char* name;    // valid until the next load or the end of the object
-    unsigned char type;  // DT_* of getdents64(2); DT_UNKNOWN only for what vanished meanwhile
+    unsigned char type;  // DT_* of getdents64(2); DT_UNKNOWN only for an entry that vanished meanwhile
   };
 
-  // Reads all entries but "." and ".." from the directory's current position, usually its start; no more than
-  // a few beyond `most`. 0 or errno; may throw std::bad_alloc.
+  // Reads all entries but "." and ".." from the directory's current position, usually its start; stops soon
+  // after `most` entries. Returns 0 or an errno; may throw std::bad_alloc.
   int load(int directory, std::size_t most = static_cast<std::size_t>(-1));
 
   // The next entry; false at the end.

@@ -4,15 +4,15 @@
 
 namespace brenvik {
 
-// Each waits until the disk has it: 0, or errno when it never will. A file system that has nothing to wait
-// for counts as done. Any thread.
+// These functions wait until the data is on the disk. They return 0, or an errno if it cannot be written. A
+// file system without a disk counts as written. Any thread.
 
-// The file: content, owner, mode, times.
+// Waits for the file's content, owner, mode and times.
 int syncFile(int file) noexcept;
-// The names in the directory. The descriptor may be one of O_PATH.
+// Waits for the names in the directory. The descriptor may be one of O_PATH.
 int syncNames(int directory) noexcept;
-// Everything on the file system of the descriptor. For trees: one wait, where each file alone would cost one
-// of its own. It also waits for what other processes have written there.
+// Waits for everything on the descriptor's file system, writes of other processes included. For trees: it is
+// one wait instead of one for each file.
 int syncFileSystem(int item) noexcept;
 
 }  // namespace brenvik

@@ -9,21 +9,21 @@
 
 namespace brenvik {
 
-// Copies what a file is beside its name: its data, and its attributes. Keeps a buffer and what it learned
-// about the file systems between calls; make one for a request. One thread.
+// Copies a file's data and attributes. Between calls it keeps a buffer and what it learned about the file
+// systems; make one object for each request. One thread.
 class FileContents {
  public:
-  // Copies the data of `source` into the empty file `destination`, both at their start; shared blocks where
-  // the file system can, holes stay holes. `info`: of the source; a file may have more or less than it says,
-  // as those of /proc and /sys do. 0 or errno. May throw std::bad_alloc.
+  // Copies the data of `source` into the empty file `destination`, both from their start. Shares blocks if
+  // the file system can, and keeps holes. `info` describes the source; the file may be longer or shorter than
+  // it says, as files of /proc and /sys are. Returns 0 or an errno. May throw std::bad_alloc.
   int copyData(int source, const struct stat& info, int destination);
 
   enum class Owner { asCreated, asSource };
   enum class Mode { asCreated, asSource };
-  // Gives `destination` the extended attributes, the mode and the times of `source`, and its owner where that
-  // is asked for and permitted; without the owner no set-id bit is passed on. Attributes that the destination
-  // cannot hold are left out; a full disk is an error. `asCreated`: it is right already. 0 or errno. May
-  // throw std::bad_alloc.
+  // Gives `destination` the extended attributes, the mode and the times of `source`, and its owner if that is
+  // asked for and permitted; without the owner, no set-id bit is copied. Attributes that the destination
+  // cannot hold are left out; a full disk is an error. `asCreated`: it is already right. Returns 0 or an
+  // errno. May throw std::bad_alloc.
   int copyAttributes(int source, const struct stat& info, int destination, Owner owner,
                      Mode mode = Mode::asSource);
 

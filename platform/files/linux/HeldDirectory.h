@@ -8,8 +8,8 @@
 
 namespace brenvik {
 
-// How many levels of a tree keep their descriptors open during a walk. Deeper ones close those far above and
-// come back through "..", so that no tree can use up the process's descriptors.
+// The number of levels of a tree that keep their descriptors open during a walk. A deeper walk closes those
+// far above and returns to them through "..", so that no tree can use up the process's descriptors.
 inline constexpr std::size_t kHeldLevels = 48;
 
 // A directory of a walk. Its descriptor may be closed, and opened again from a directory inside it.
@@ -20,9 +20,9 @@ class HeldDirectory {
 
   int get() const noexcept { return fd_.get(); }
 
-  // Closes the descriptor, remembering which directory it was. 0 or errno; kept open on failure.
+  // Closes the descriptor and remembers the directory. Returns 0, or an errno and keeps it open.
   int giveUp() noexcept;
-  // Opens it again as the parent of `child`. 0 or errno; ESTALE when the child was moved elsewhere meanwhile.
+  // Opens it again as the parent of `child`. Returns 0 or an errno; ESTALE if the child was moved meanwhile.
   int takeAgain(int child) noexcept;
 
  private:

@@ -115,7 +115,7 @@ int openToChange(int directory, const char* name, const struct stat& folder, con
                  UniqueFd* item, struct stat* info) {
   item->reset(::openat(directory, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
   if (!item->isValid() || ::fstat(item->get(), info) != 0) return errno;
-  // Whoever may write in a directory can put a second name of somebody else's file into it.
+  // An account that may write to a directory can put a hard link to somebody else's file into it.
   const bool hasOtherNames = !S_ISDIR(info->st_mode) && info->st_nlink > 1;
   const bool isFromElsewhere = info->st_uid != folder.st_uid || (folder.st_mode & 0022) != 0;
   return hasOtherNames && isFromElsewhere && !has(*info, attributes) ? EPERM : 0;

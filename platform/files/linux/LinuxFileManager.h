@@ -17,7 +17,7 @@
 
 namespace brenvik {
 
-// The file manager on Linux: at and beneath directory descriptors, see FileManager for the contract.
+// The file manager on Linux, which works at and beneath directory descriptors. FileManager has the contract.
 class LinuxFileManager final : public FileManager {
  public:
   void openScope() noexcept override { ++scopes_; }

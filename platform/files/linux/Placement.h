@@ -13,29 +13,29 @@
 
 namespace brenvik {
 
-// Removes what killed processes have left in the directory: what a Stage or placeLink() had made there, and
-// nothing else. Placement.cpp says how it recognises them (hidden names). May throw std::bad_alloc.
+// Removes the hidden items that a Stage or placeLink() of a killed process left in the directory, and nothing
+// else. Placement.cpp says how it recognises them. May throw std::bad_alloc.
 void removeLeftovers(int directory);
 
-// Makes a symbolic link at the place. What stands there gives way in one step; an empty directory is removed
-// first. 0, or errno and nothing has changed.
+// Makes a symbolic link at the place. Replaces a non-directory there in one step; removes an empty directory
+// first. Returns 0, or an errno if nothing has changed.
 int placeLink(const Place& place, const std::string& target);
 
-// A new item in the making. It stands in a hidden directory beside its place, which only this process's
-// account may enter, or has no name at all, until it shows at its place whole. One thread.
+// A new item that is not yet visible. Until publish() it is in a hidden directory beside its place, which
+// only this process's account may enter, or has no name at all. One thread.
 class Stage {
  public:
   enum class Undo { no, possible };
 
-  // `place` outlives the object. With Undo::possible a publication can be taken back.
+  // `place` must outlive the object. With Undo::possible, takeBack() is possible.
   explicit Stage(const Place& place, Undo undo = Undo::no) : place_(place), undo_(undo) {}
   Stage(const Stage&) = delete;
   Stage& operator=(const Stage&) = delete;
-  // Removes what was not published, and what gave way.
+  // Removes the item if it was not published, and the item that it replaced.
   ~Stage();
 
-  // Make the item: an empty directory (mode 0700), an empty file (mode 0600), or nothing yet: then the caller
-  // makes one as itemName() in room(). 0 or errno.
+  // Make an empty directory (mode 0700), an empty file (mode 0600), or only the room: the caller then makes
+  // the item as itemName() in room(). Return 0 or an errno.
   int makeDirectory();
   int makeFile();
   int makeRoom();
@@ -44,14 +44,15 @@ class Stage {
   int room() const noexcept { return room_.get(); }
   static const char* itemName() noexcept { return "new"; }
 
-  // Shows the item under the place's name. 0 or errno: EEXIST when something is there that does not give way.
+  // Moves the item to the place's name. Returns 0 or an errno; EEXIST if `ifPresent` does not let it replace
+  // the item there.
   int publish(IfPresent ifPresent);
-  // Takes the item away from its place, and puts back what gave way. 0 or errno. Only after publish(), and
-  // with Undo::possible.
+  // Takes the item away from its place and puts back the item that it replaced. Returns 0 or an errno. Only
+  // after publish(), and with Undo::possible.
   int takeBack();
 
-  // The other way round: the item with this information goes from the place into the room, in one step, and
-  // away with this object. 0 or errno; then it stands where it stood. After makeRoom().
+  // Moves the item with this `info` from the place into the room, in one step; the destructor removes it.
+  // Returns 0, or an errno and leaves the item at its place. Only after makeRoom().
   int take(const struct stat& info);
 
  private:
@@ -64,7 +65,7 @@ class Stage {
   UniqueFd room_;
   UniqueFd fd_;
   bool isUnnamed_ = false;
-  bool exchanged_ = false;  // what gave way stands in the room
+  bool exchanged_ = false;  // the replaced item is in the room
 };
 
 }  // namespace brenvik

@@ -13,28 +13,28 @@
 
 namespace brenvik {
 
-// Takes what a program writes.
+// Receives the output of a program.
 class ReaderOutput {
  public:
   virtual ~ReaderOutput() = default;
-  // The next bytes. 0 to go on, else the value that ends it.
+  // Takes the next bytes. Returns 0 to go on; any other value ends drain(), which returns it.
   virtual int take(std::string_view bytes) = 0;
-  // How many bytes the next piece should have at most.
+  // The most bytes that the next piece should have.
   virtual std::size_t bestPiece() const = 0;
   // Whether the program may end here.
   virtual bool isComplete() const = 0;
 
-  // The next bytes may go into the file at its position instead, at most so many.
+  // A file that the next bytes may be written to at its position, instead of take(), and how many at most.
   struct Direct {
     int file = -1;
     std::size_t bytes = 0;
   };
   virtual Direct direct() const = 0;
-  // So many bytes went there.
+  // Called after this many bytes were written to that file.
   virtual void wentDirectly(std::size_t bytes) = 0;
 };
 
-// A program reading a file and writing to this process. Killed and reaped with the object. One thread.
+// A program that reads a file and writes to this process. The destructor kills and reaps it. One thread.
 class ReaderProcess {
  public:
   ReaderProcess() = default;
@@ -42,12 +42,12 @@ class ReaderProcess {
   ReaderProcess& operator=(const ReaderProcess&) = delete;
   ~ReaderProcess();
 
-  // Starts the program with `input` as its standard input, without arguments, and with no descriptor of this
-  // process but that and its output. 0 or errno.
+  // Starts the program without arguments. Its standard input is `input`; it gets no other descriptor of this
+  // process but its output. Returns 0 or an errno.
   int start(const std::string& program, int input);
 
-  // Hands on what the program writes until that fails (then the answer is its value), the program closes its
-  // output (EPIPE, unless isComplete()) or the time is over (ETIMEDOUT).
+  // Passes the program's output to `to` until take() fails (returns its value), the program closes its output
+  // (returns EPIPE, or 0 if isComplete()) or the deadline has passed (returns ETIMEDOUT).
   int drain(std::chrono::steady_clock::time_point deadline, ReaderOutput& to);
 
  private:

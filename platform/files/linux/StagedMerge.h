@@ -4,13 +4,13 @@
 
 namespace brenvik {
 
-// Whether everything in the directory `staged` can take its place in the directory `destination`: a directory
-// where a directory (no link) or nothing is, anything else where no directory is. 0, or EEXIST. At most 100
-// levels deep. May throw std::bad_alloc.
+// Checks that everything in the directory `staged` can be moved into the directory `destination`: a directory
+// onto a directory (not a link) or onto nothing, anything else onto anything but a directory. Returns 0 or an
+// errno; EEXIST if it cannot. Goes at most 100 levels deep. May throw std::bad_alloc.
 int checkMerge(int staged, int destination);
 
-// Moves it there; each file that is replaced gives way in one step. 0 or errno; what could not be moved
-// stays. Only after checkMerge, and on one file system.
+// Moves everything there and replaces each existing file in one step. Returns 0 or an errno; items that could
+// not be moved stay in `staged`. Only after checkMerge(), and on one file system.
 int mergeStaged(int staged, int destination);
 
 }  // namespace brenvik

@@ -4,9 +4,9 @@
 
 namespace brenvik {
 
-// Removes the entry `name` of the directory and, when it is a directory itself, everything below it. Links
-// are removed, not followed. Goes on past what cannot be removed. 0, or the first errno. A lack of memory
-// makes it slow and no more than that. Any thread.
+// Removes the entry `name` of the directory, and everything below it if it is a directory. Removes links
+// without following them. Continues past items that cannot be removed. Returns 0 or the first errno. A lack
+// of memory only makes it slower. Any thread.
 int removeTree(int directory, const char* name) noexcept;
 
 }  // namespace brenvik

@@ -13,9 +13,9 @@
 
 namespace brenvik {
 
-// Goes through everything below a directory, depth first, from one held descriptor to the next. No link is
-// followed and no path is resolved, so nobody can lead the walk out of the tree. The names in a directory are
-// read when the walk enters it; the hooks may change the tree. One thread; may throw std::bad_alloc.
+// Walks everything below a directory, depth first, from one open descriptor to the next. It follows no link
+// and resolves no path, so nobody can lead it out of the tree. It reads a directory's names when it enters
+// the directory; the hooks may change the tree. One thread; may throw std::bad_alloc.
 class TreeWalk {
  public:
   struct Level {
@@ -23,7 +23,7 @@ class TreeWalk {
     HeldDirectory counterpart;  // the same directory in a second tree, for a walk of two trees
     struct stat info {};        // for the hooks; the walk does not fill it in
     DirectoryNames names;
-    std::size_t pathLength = 0;  // of the path down to this directory, with its slash
+    std::size_t pathLength = 0;  // bytes of the path down to this directory, with its slash
   };
 
   TreeWalk() = default;
@@ -32,18 +32,18 @@ class TreeWalk {
   virtual ~TreeWalk() = default;
 
  protected:
-  // Walks everything below the level's directory. 0, or the first value that a hook returned; ESTALE if
-  // somebody moved a directory so that the way back up is lost.
+  // Walks everything below the level's directory. Returns 0, or the first other value that a hook returned;
+  // ESTALE if somebody moved a directory, so that the walk cannot return to its parent.
   int walk(Level top);
 
-  // The walk has come to an entry. Sets *descend for a directory that is to be walked. This hook and the
-  // others return 0 to go on, or an errno value that ends the walk.
+  // Called for each entry. Sets *descend if the walk should enter this directory. Like every hook, it returns
+  // 0 to go on, or an errno value to end the walk.
   virtual int visit(Level& level, const DirectoryNames::Entry& entry, bool* descend) = 0;
-  // A directory below `above` is open; its names have not been read.
+  // Called when a directory below `above` has been opened, before its names are read.
   virtual int opened(Level& above, Level& below);
-  // Opening the directory, reading its names or opened() failed. The default ends the walk.
+  // Called when opening the directory, reading its names or opened() failed. The default ends the walk.
   virtual int cannotEnter(Level& level, const char* name, int error);
-  // Everything in the directory has been visited. `above` is null for the top.
+  // Called when everything in the directory has been visited. `above` is null for the top.
   virtual int left(Level& done, Level* above);
 
   // The path of the entry visited, entered or left, below the top.

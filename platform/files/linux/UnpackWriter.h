@@ -18,17 +18,17 @@ struct UnpackOptions {
   bool resources = false;
 };
 
-// Writes an archive's entries beneath a directory that nobody else writes to, and nowhere else: every path is
-// checked, and the kernel is told to follow no link and leave no subtree. Files get their time and, like
-// directories, the permission bits that the archive has; directories without an entry get 0755. One thread;
-// may throw std::bad_alloc.
+// Writes an archive's entries beneath a directory that nobody else writes to, and nowhere else: it checks
+// every path, and the kernel follows no link and stays within the subtree. Files and directories get the
+// archive's permission bits, files its times too; directories without an entry get mode 0755. One thread; may
+// throw std::bad_alloc.
 class UnpackWriter final : public ArchiveFrameSink {
  public:
   static constexpr std::uint64_t kMaxEntries = 100'000;
   static constexpr std::uint64_t kMaxBytes = std::uint64_t{1} << 30;
 
-  // `top` outlives the object. `mostBytes`: of all files together. `onFileError` answers as ArchiveCopier
-  // says.
+  // `top` must outlive the object. `mostBytes` limits all files together. `onFileError` returns an
+  // archive_answer (ArchiveCopier.h).
   UnpackWriter(int top, UnpackOptions options, std::uint64_t mostBytes,
                std::function<int(const ArchiveFileError&)> onFileError);
 
@@ -37,18 +37,18 @@ class UnpackWriter final : public ArchiveFrameSink {
   int entryCompanion(std::string_view bytes) override;
   int endEntry() override;
   int refuseEntry(const std::string& path, int code) override;
-  // Where the current entry's next data may be written to without entryData(), and at most how much of it.
+  // A file that takes the current entry's next data without entryData(), and how much of it at most.
   struct Room {
     int file = -1;
     std::size_t bytes = 0;
   };
   Room roomForData() const;
-  // So much has been written there.
+  // Call it after this many bytes were written there.
   void dataWritten(std::size_t bytes);
-  // After the last entry. 0 or errno.
+  // Call it after the last entry. Returns 0 or an errno.
   int finish();
 
-  // Whether what ended the copy was an answer of onFileError; then there is nothing more to say about it.
+  // Whether an answer of onFileError ended the copy; then no fatal error is reported.
   bool wasStoppedByAnswer() const { return stoppedByAnswer_; }
 
  private:
@@ -70,7 +70,7 @@ class UnpackWriter final : public ArchiveFrameSink {
   std::uint64_t bytes_ = 0;
   bool stoppedByAnswer_ = false;
 
-  std::map<std::string, mode_t> closed_;  // directories that an ordinary user could not write into any more
+  std::map<std::string, mode_t> closed_;  // final modes of directories that their owner could not write to
 
   std::string parentPath_;  // of parent_
   UniqueFd parent_;
@@ -81,7 +81,7 @@ class UnpackWriter final : public ArchiveFrameSink {
   std::uint64_t written_ = 0;
   UniqueFd file_;
   UniqueFd companion_;
-  std::string companionHead_;  // as much as attributes are looked for in
+  std::string companionHead_;  // the part that is searched for attributes
 };
 
 }  // namespace brenvik

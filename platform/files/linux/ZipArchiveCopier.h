@@ -12,20 +12,20 @@ namespace brenvik {
 
 class UnpackWriter;
 
-// Unpacks zip archives. The archive is read by a short-lived process without rights, brenvik-archive-reader;
-// what it reports is written by this one, into a hidden directory first. A reader that dies, says nonsense or
-// takes too long is a failed copy.
+// Unpacks zip archives. A short-lived process without rights, brenvik-archive-reader, reads the archive; this
+// process writes the entries, into a hidden directory first. The copy fails if the reader dies, sends
+// malformed data or takes too long.
 class ZipArchiveCopier final : public ArchiveCopier {
  public:
-  // 1 GiB, the most that is unpacked, takes a tenth of it on a slow disk.
+  // At most 1 GiB is unpacked, which takes a tenth of this time on a slow disk.
   static constexpr std::chrono::seconds kLongestCopy{60};
 
   // `reader`: path of the reader's program.
   explicit ZipArchiveCopier(std::string reader, std::chrono::milliseconds longest = kLongestCopy)
       : reader_(std::move(reader)), longest_(longest) {}
 
-  // Copiers with the reader found beside this process's own program, else in the installed place; none where
-  // there is no reader.
+  // Makes copiers with the reader beside this process's own program, else with the installed one. The factory
+  // returns null if there is no reader.
   static ArchiveCopierFactory factory();
 
   void setFileErrorHandler(std::function<int(const ArchiveFileError&)> handler) override {

@@ -4,9 +4,10 @@
 
 namespace brenvik {
 
-// Takes from this process, for good, all it does not need to read an open archive and write to an open pipe:
-// its user (where it may change it), memory, processor time, core dumps, new privileges, and every system
-// call but a handful, which end it. Then tries one that must be refused. False: not confined, read nothing.
+// Irrevocably limits this process to reading an open archive and writing to an open pipe: it drops its user
+// (if it may change it), limits memory and processor time, forbids core dumps and new privileges, and kills
+// the process at any system call but a handful. Then it tests that a forbidden call is refused. Returns false
+// if the process is not confined; it must then read nothing.
 bool confineThisProcess();
 
 }  // namespace brenvik

@@ -11,7 +11,7 @@
 namespace brenvik {
 
 // The shared country configuration. The code comes from its file; else from the last address that this
-// process was given; else from the system's time zone, when that belongs to a country. Any thread.
+// process learned; else from the system's time zone, if that belongs to a country. Any thread.
 class CountryConfiguration {
  public:
   struct Files {
@@ -28,7 +28,7 @@ class CountryConfiguration {
   void setLastGeocoded(std::string countryCode);
 
  private:
-  // What tells one state of a file from the next.
+  // Tells one state of a file from the next.
   struct Identity {
     dev_t device = 0;
     ino_t inode = 0;
@@ -44,10 +44,10 @@ class CountryConfiguration {
 
   const Files files_;
   std::mutex mutex_;
-  std::optional<Identity> identity_;  // of the configuration file that was read; none: it was not there
+  std::optional<Identity> identity_;  // of the configuration file that was read; none: there was no file
   std::optional<std::string> configured_;
   std::optional<std::string> lastGeocoded_;
-  std::optional<std::string> zoneLink_;  // where the link of local time led when its country was looked up
+  std::optional<std::string> zoneLink_;  // the target of the local time link whose country was looked up
   std::optional<std::string> zoneCountry_;
 };
 

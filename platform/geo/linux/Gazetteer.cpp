@@ -170,7 +170,7 @@ bool Gazetteer::open(std::string& error) {
     error = functions->errstr(code);
     return false;
   }
-  // Whoever could write the file could otherwise have its views and functions run here, with our rights.
+  // Otherwise an account that can write the file could run its views and functions here, with our rights.
   (void)functions->db_config(handle, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
   (void)functions->db_config(handle, SQLITE_DBCONFIG_TRUSTED_SCHEMA, 0, nullptr);
 

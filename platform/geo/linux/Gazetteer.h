@@ -16,25 +16,24 @@
 
 namespace brenvik {
 
-// The offline gazetteer: a read-only SQLite database of borders and places. The country code is that of the
-// border that the coordinate lies in, or of the table of disputed land; city and administrative area are
+// The offline gazetteer: a read-only SQLite database of borders and places. The country code comes from the
+// border that the coordinate lies in, or from the table of disputed land; city and administrative area are
 // those of the town that a resident would name. One thread at a time.
 class Gazetteer {
  public:
-  // Opens nothing; the database is opened by the first look-up, and again by each that finds it closed.
+  // Opens nothing. The first look-up opens the database, and so does each look-up that finds it closed.
   explicit Gazetteer(std::string path) : path_(std::move(path)) {}
 
   struct Answer {
-    std::optional<StructuredAddress> address;  // absent, without error: nothing is known of the coordinate
+    std::optional<StructuredAddress> address;  // absent, without error: nothing is known about the coordinate
     std::optional<GeoError> error;
   };
-  // The coordinate has to be one: latitude within 90 degrees, longitude within 180. Postal codes are not
-  // known.
+  // Precondition: latitude within 90 degrees, longitude within 180. The gazetteer has no postal codes.
   Answer lookUp(Coordinate coordinate);
 
-  // The code that this gazetteer's rules give a place that another source puts into `country`: the
-  // territory's own code instead of its sovereign's, and the table's answer on disputed land. Otherwise
-  // `country`, and so when the database cannot be read. The coordinate has to be one.
+  // Corrects the `country` that another source gives for a place by this gazetteer's rules: returns a
+  // territory's own code instead of its sovereign's, and the table's answer on disputed land. Otherwise, or
+  // if the database cannot be read, returns `country`. Precondition as for lookUp().
   std::string ownCode(Coordinate coordinate, const std::string& country);
 
  private:
@@ -55,10 +54,10 @@ class Gazetteer {
   };
   // What a search has found so far.
   struct Found {
-    std::optional<Town> nearest;  // whatever its size: its area is the position's
-    std::vector<Town> best;       // of each area the town of the least score
+    std::optional<Town> nearest;  // of any size; the position is in its area
+    std::vector<Town> best;       // the town with the lowest score in each area
     Town* bestOf(std::uint16_t area);
-    // Of the found, which are not none, the one that names the position.
+    // The town that names the position. Precondition: one was found.
     const Town& town();
   };
   struct Country {
@@ -73,23 +72,23 @@ class Gazetteer {
   static Position positionOf(Coordinate coordinate);
   bool open(std::string& error);
   bool readTables();
-  // Ends a run of a statement, whose last step gave `code`.
+  // Ends a run of a statement whose last step returned `code`.
   void finish(Query& statement, int code);
   Land landAround(Position position);
   Land landAt(Position position);
   Land decide(std::span<const std::uint16_t> around) const;
-  // The town that names the position: of the towns in the area of the nearest place the one of the least
-  // score. Of the country unless that is 0.
+  // Returns the town that names the position: among the towns in the area of the nearest place, the one with
+  // the lowest score. Only towns of `country`, unless that is 0.
   std::optional<Town> townNear(Position position, std::uint8_t country);
   void searchRow(Position position, std::uint8_t country, std::int64_t row, std::int64_t west,
                  std::int64_t east, double kilometres, Found& found);
   void searchSquare(Position position, std::uint8_t country, std::int64_t cell,
                     std::span<const std::byte> data, double kilometres, Found& found);
-  // Name and area of a place.
+  // Writes the town's name and area into the address.
   void nameTown(const Town& town, StructuredAddress& address);
 
   const std::string path_;
-  // The statements go before their database does.
+  // The statements are destroyed before their database.
   struct Opened {
     SqliteDatabase database;
     Query land;
@@ -100,7 +99,7 @@ class Gazetteer {
     std::vector<Rule> rules;
   };
   std::optional<Opened> opened_;
-  std::optional<std::string> failure_;  // the first error that a statement of this look-up met
+  std::optional<std::string> failure_;  // the first error of a statement in this look-up
 };
 
 }  // namespace brenvik

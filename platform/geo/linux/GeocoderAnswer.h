@@ -10,17 +10,17 @@
 
 namespace brenvik {
 
-// The largest answer a reverse geocoder may give; a usual one has a kilobyte.
+// The largest answer of a reverse geocoder, in bytes; a usual one has a kilobyte.
 inline constexpr std::size_t kLargestGeocoderAnswer = std::size_t{256} << 10;
 
-// What the body of a Nominatim-compatible server's answer (format jsonv2) says.
+// The parsed body of a Nominatim-compatible server's answer (format jsonv2).
 struct GeocoderAnswer {
-  std::optional<StructuredAddress> address;  // absent, without error: the server knows nothing of the place
-  std::optional<GeoError> error;             // the body is no such answer
+  std::optional<StructuredAddress> address;  // absent, without error: the server does not know the place
+  std::optional<GeoError> error;             // the body is malformed
 };
 
-// A part of the address that is not a text, is empty or holds a NUL counts as absent, as does a country code
-// of anything but two letters. Throws nothing but std::bad_alloc.
+// A part of the address counts as absent if it is not a text, is empty or contains a NUL; so does a country
+// code that is not two letters. Throws only std::bad_alloc.
 GeocoderAnswer readGeocoderAnswer(std::string_view body);
 
 }  // namespace brenvik

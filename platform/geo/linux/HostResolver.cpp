@@ -38,7 +38,7 @@ std::vector<SocketAddress> addressesOf(const HostAndPort& server, int flags) {
   return found;
 }
 
-// A look-up on its way: shared by the thread that does it and whoever waits for it.
+// A look-up under way, shared by the thread that does it and the threads that wait for it.
 struct LookUp {
   HostAndPort server;
   UniqueFd finished{::eventfd(0, EFD_CLOEXEC)};  // readable, and stays so, when it is done

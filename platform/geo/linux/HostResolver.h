@@ -23,10 +23,10 @@ struct HostAndPort {
 };
 HostAndPort splitHostAndPort(const std::string& text, const char* defaultPort);
 
-// UDP addresses of a host, in the order of RFC 6724; empty when there are none, when the name servers need
-// longer than `patience`, or when `stopFd` becomes readable. The C library's look-up cannot be called off, so
-// it runs on a thread of its own that is left behind when it is late; one such thread at most, which a later
-// call for the same host joins. Any thread.
+// Returns the UDP addresses of a host, in the order of RFC 6724; none if there are none, if the name servers
+// need longer than `patience`, or if `stopFd` becomes readable. The C library's look-up cannot be cancelled,
+// so it runs on its own thread, which is left behind if it is late. There is at most one such thread; a later
+// call for the same host waits for it. Any thread.
 std::vector<SocketAddress> resolveUdp(const HostAndPort& server, std::chrono::milliseconds patience,
                                       int stopFd);
 

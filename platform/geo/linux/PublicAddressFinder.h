@@ -14,28 +14,28 @@
 
 namespace brenvik {
 
-// Finds the address under which this device is seen from outside. Each question has a STUN transaction of its
-// own, which begins at once, on a queue of its own. Where there are kMaxTransactions already, or no thread
-// for another one, a question shares the transaction that began last.
+// Finds this device's public address. Each question starts a STUN transaction at once, on a queue of its own.
+// If kMaxTransactions are under way, or there is no thread for another, the question shares the transaction
+// that began last.
 class PublicAddressFinder : public std::enable_shared_from_this<PublicAddressFinder> {
  public:
-  // A transaction takes eight seconds at most, and a usual one a fraction of one: more come from a caller
-  // that floods, and need not become a flood of datagrams.
+  // A transaction takes at most eight seconds, usually a fraction of one. Only a flood of requests needs
+  // more, and it must not cause a flood of datagrams.
   static constexpr std::size_t kMaxTransactions = 4;
 
   // Called on a queue of the finder's.
   using Deliver = std::function<void(const StunOutcome&)>;
-  // Makes the network of one transaction, whose waiting ends when the descriptor becomes readable. Any
-  // thread.
+  // Makes the network of one transaction. Its waits end when `stopFd` becomes readable. Any thread.
   using MakeNetwork = std::function<std::unique_ptr<StunNetwork>(int stopFd)>;
 
-  // The queues outlive it, or its stop(). Throws OutOfQueues when no descriptor is left.
+  // The queues must outlive it or its stop(). Throws OutOfQueues if no descriptor is left.
   PublicAddressFinder(MakeNetwork makeNetwork, WorkQueues& queues);
 
-  // Any thread. An error where there is no thread at all; that comes from within the call.
+  // Delivers the address, or an error, later. If no thread can be started, delivers an error within this
+  // call. Any thread.
   void find(Deliver deliver);
-  // Ends the transactions that run and their threads; nothing is delivered from now on. Not on a queue of the
-  // finder's.
+  // Ends the running transactions and their threads; nothing is delivered afterwards. Do not call it on one
+  // of the finder's queues.
   void stop() noexcept;
 
  private:

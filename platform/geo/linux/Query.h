@@ -12,11 +12,11 @@
 
 namespace brenvik {
 
-// A prepared statement that is run again and again. Parameters count from 1, columns from 0; codes are
-// SQLite's. It must not outlive its database.
+// A prepared statement that is run many times. Parameters count from 1, columns from 0; codes are SQLite's.
+// The database must outlive it.
 class Query {
  public:
-  // Resets a statement at the end of the scope, also when an exception ends it.
+  // Resets a statement at the end of the scope, even after an exception.
   class Run {
    public:
     explicit Run(Query& query) noexcept : query_(query) {}
@@ -29,7 +29,7 @@ class Query {
   };
 
   Query() = default;
-  // Not valid when SQLite refuses the text.
+  // The object is invalid if SQLite refuses the text.
   Query(const SqliteFunctions& functions, sqlite3* database, std::string_view sql) noexcept
       : sqlite_(&functions) {
     sqlite3_stmt* statement = nullptr;
@@ -47,9 +47,9 @@ class Query {
     note(sqlite_->bind_text(statement_.get(), parameter, value.data(), static_cast<int>(value.size()),
                             SQLITE_STATIC));
   }
-  // SQLITE_ROW, SQLITE_DONE or an error; of a binding or a text that failed, too.
+  // Returns SQLITE_ROW, SQLITE_DONE or an error, also the error of an earlier binding or text.
   int step() noexcept { return failure_ != SQLITE_OK ? failure_ : sqlite_->step(statement_.get()); }
-  // Of a binding, or of a text of the last row. SQLITE_OK: none.
+  // The error of a binding, or of a text in the last row; SQLITE_OK: none.
   int failure() const noexcept { return failure_; }
   // Makes it ready to run again; the bindings stay.
   void reset() noexcept {
@@ -57,7 +57,7 @@ class Query {
     failure_ = SQLITE_OK;
   }
 
-  // Of the present row; views hold until the next step or reset.
+  // These read the current row; views are valid until the next step or reset.
   bool isNull(int column) const noexcept {
     return sqlite_->column_type(statement_.get(), column) == SQLITE_NULL;
   }

@@ -16,9 +16,9 @@
 
 namespace brenvik {
 
-// From sending a request to the end of its answer.
+// The time limit from sending a request to the end of its answer.
 inline constexpr std::chrono::seconds kGeocoderPatience{10};
-// Between two requests. One second is what public servers ask of their users; a server of one's own may need
+// The pause between two requests. Public servers ask their users for one second; a private server may need
 // none.
 inline constexpr std::chrono::milliseconds kGeocoderPace{BRENVIK_GEOCODER_PACE};
 // The longest that a request waits for its turn; after that the offline gazetteer answers.
@@ -42,11 +42,10 @@ class ReverseGeocoder : public std::enable_shared_from_this<ReverseGeocoder> {
         pace_(pace),
         gazetteer_(std::move(gazetteerPath)) {}
 
-  // Answers later, unless closed by then. On `queue`, which the caller keeps while there is something to
-  // answer.
+  // Answers later on `queue`, unless closed by then. The caller keeps the queue alive until the answer.
   void lookUp(Coordinate coordinate, Deliver deliver, const std::shared_ptr<WorkQueue>& queue);
 
-  // Waits for a look-up that is at work; nothing outside this object is used afterwards. Any thread.
+  // Waits for a look-up that is running; afterwards nothing outside this object is used. Any thread.
   void close() noexcept;
 
  private:

@@ -7,7 +7,7 @@
 #include <span>
 #include <string>
 
-// The two messages of a STUN binding transaction (RFC 8489) that finding one's public address takes.
+// The two messages of a STUN binding transaction (RFC 8489), which finds the public address.
 namespace brenvik {
 
 using StunTransactionId = std::array<std::byte, 12>;
@@ -27,8 +27,8 @@ struct StunAnswer {
   std::string address;  // IPv4 or IPv6, as inet_ntop(3) writes it
 };
 
-// What a datagram from the server says to the request with this id. No host has an address of another family
-// than IPv4 and IPv6, the unspecified one, one of 0/8, a multicast or a reserved one.
+// Reads a datagram from the server as the answer to the request with this id. An address that no host can
+// have counts as none: a family other than IPv4 and IPv6, unspecified, in 0/8, multicast or reserved.
 StunAnswer readStunAnswer(std::span<const std::byte> datagram, const StunTransactionId& id);
 
 }  // namespace brenvik

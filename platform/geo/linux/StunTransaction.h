@@ -15,7 +15,8 @@
 
 namespace brenvik {
 
-// When a request that has had no answer is sent again, and when it is given up, counted from its beginning.
+// The times, counted from the beginning, at which an unanswered request is sent; kStunPatience is when it is
+// given up.
 inline constexpr std::array<std::chrono::milliseconds, 5> kStunSchedule{
     std::chrono::milliseconds{0}, std::chrono::milliseconds{250}, std::chrono::milliseconds{750},
     std::chrono::milliseconds{1750}, std::chrono::milliseconds{3750}};
@@ -34,17 +35,18 @@ class StunNetwork {
   virtual ~StunNetwork() = default;
   // Time since the transaction began.
   virtual std::chrono::nanoseconds elapsed() = 0;
-  // Addresses of the server, the preferred one first. May take its time, but not longer than `until`.
+  // Finds the server's addresses, the preferred one first, and returns their number. Takes no longer than
+  // `until`.
   virtual std::size_t findPeers(std::chrono::nanoseconds until) = 0;
-  // False when the peer cannot be reached.
+  // Returns false if the peer cannot be reached.
   virtual bool send(std::size_t peer, std::span<const std::byte> datagram) = 0;
   // Waits for a datagram or a failure of any peer that has not failed yet.
   virtual Event wait(std::chrono::nanoseconds until) = 0;
 };
 
-// Asks the server for the address it sees. The preferred peer is asked first, the others from the second
-// sending on, or at once when the preferred one fails. What does not answer the request is ignored, and said
-// once in the log. Nothing but a server's answer is ever taken for the address.
+// Asks the server for the address it sees. The preferred peer is asked first; the others from the second
+// sending on, or at once if the preferred one fails. Datagrams that do not answer the request are ignored and
+// logged once. Only a server's answer is ever taken as the address.
 struct StunOutcome {
   std::optional<std::string> address;
   std::optional<GeoError> error;

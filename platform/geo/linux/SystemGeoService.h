@@ -18,8 +18,8 @@ namespace brenvik {
 class PublicAddressFinder;
 
 // The geo service's look-ups on Linux: addresses from a server or the offline gazetteer, the public address
-// by STUN. Queues of its own do the work, each made with the first question that needs it: one for places,
-// one for each transaction that runs at a time.
+// by STUN. It works on its own queues, each made with the first question that needs it: one for places, and
+// one for each STUN transaction that runs at the same time.
 class SystemGeoService final : public GeoTickets {
  public:
   struct Settings {
@@ -28,12 +28,12 @@ class SystemGeoService final : public GeoTickets {
     std::string stunServer;   // host or host:port
   };
 
-  // The references outlive this object; the web client is used only when there is a geocoder. Cheap: opens
+  // The references must outlive this object; the web client is used only if there is a geocoder. Cheap: opens
   // nothing.
   SystemGeoService(WorkQueues& queues, WebClient& webClient, Settings settings);
   SystemGeoService(const SystemGeoService&) = delete;
   SystemGeoService& operator=(const SystemGeoService&) = delete;
-  // Ends what is under way without answering it; does not wait for the network.
+  // Ends the look-ups under way without an answer; does not wait for the network.
   ~SystemGeoService() override;
 
   std::unique_ptr<ReverseGeocodeTicket> makeReverseGeocodeTicket(Coordinate coordinate, IncludeEta includeEta,

@@ -12,11 +12,12 @@
 
 namespace brenvik {
 
-// The real network: one connected UDP socket a peer, the first address of each family that the server has.
+// The real network: one connected UDP socket for each peer; the peers are the server's first address of each
+// family.
 class UdpStunNetwork final : public StunNetwork {
  public:
-  // `server` is host:port; 3478 when the port is left out. The time begins. When `stopFd` becomes readable,
-  // whatever waits ends.
+  // `server` is host:port; the default port is 3478. The transaction's time begins here. Every wait ends when
+  // `stopFd` becomes readable.
   UdpStunNetwork(std::string server, int stopFd);
 
   std::chrono::nanoseconds elapsed() override;

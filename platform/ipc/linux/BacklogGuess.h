@@ -18,11 +18,11 @@ class BacklogGuess {
 
   // Only one in so many turns is timed, because reading the clock twice costs 1 % of a call.
   static constexpr unsigned kTimedTurns = 8;
-  // The loop comes back in a third of that with a message that is there. A client that is asleep takes three
+  // If a message is there, the loop comes back with it in a third of that time. A sleeping client takes three
   // times as long to wake up and send.
   static constexpr std::chrono::nanoseconds kAtOnce{1000};
 
-  // The channel's turn begins, or ends. `now` tells the time, and is called when the turn is timed.
+  // The channel's turn begins, or ends. `now` returns the time; it is called only if the turn is timed.
   template <class Now>
   void turnBegins(Now&& now) {
     if (isTimed_) isLikely_ = now() - ended_ < kAtOnce;
@@ -37,14 +37,14 @@ class BacklogGuess {
   // A look found nothing.
   void foundNothing() noexcept { isLikely_ = false; }
 
-  // Whether a look is worth it.
+  // Whether it is worth looking for another message.
   bool isLikely() const noexcept { return isLikely_; }
 
  private:
   bool isLikely_ = false;
   bool isTimed_ = false;
   unsigned turns_ = 0;
-  Time ended_{};  // of a turn that is timed
+  Time ended_{};  // when the last timed turn ended
 };
 
 }  // namespace brenvik

@@ -10,18 +10,18 @@
 
 namespace brenvik {
 
-// The connections of a service, oldest first: those that have not checked in (strangers), in all and by
-// account, and those that have. Each step takes constant time. Owns nothing.
+// Lists the connections of a service, oldest first: those that have not checked in (strangers), in total and
+// by account, and those that have. Each call takes constant time. The lists do not own the connections.
 class ConnectionBooks {
  public:
-  // A client sends its check-in at once, so few connections are ever waiting. What one account may hold is
+  // A client sends its check-in at once, so few connections are ever waiting. The limit of one account is
   // below the total, so that it cannot crowd out the others.
   static constexpr std::size_t kMaxStrangers = 128;
   static constexpr std::size_t kMaxStrangersPerAccount = 64;
-  // A client that has checked in needs its connection only to check in once more.
+  // A client that has checked in needs its connection only to check in again.
   static constexpr std::size_t kMaxAdmitted = 32;
 
-  // What a connection is derived from. It is struck out before it is destroyed.
+  // The base class of a connection. The owner removes it from the lists before it destroys it.
   class Entry {
    public:
     explicit Entry(uid_t account) noexcept : account_(account) {}
@@ -36,16 +36,17 @@ class ConnectionBooks {
     std::list<Entry*>::iterator inAccount_;
   };
 
-  // Enters a stranger; nothing is changed when it throws bad_alloc.
+  // Adds a stranger. Throws std::bad_alloc, and then nothing has changed.
   void add(Entry& entry);
-  // The stranger has checked in. Once more: nothing changes. Throws nothing.
+  // Records that the stranger has checked in. A second call changes nothing.
   void admit(Entry& entry) noexcept;
   void remove(Entry& entry) noexcept;
 
-  // The connection that must be closed, if one must: the oldest stranger of an account that has too many,
-  // else the oldest stranger of all when there are too many. `entry` is the one that came last.
+  // Returns the connection that must be closed after `entry`, the newest one, was added: the oldest stranger
+  // of its account if that has too many, else the oldest of all strangers if there are too many, else null.
   Entry* overdueAfter(const Entry& entry) const noexcept;
-  // The connection of a client that may be closed since there are too many of those. The client stays.
+  // Returns the oldest connection of a checked-in client if there are too many of those, else null. It may be
+  // closed: the client itself stays checked in.
   Entry* overdueAdmitted() const noexcept;
   Entry* oldestStranger() const noexcept { return strangers_.empty() ? nullptr : strangers_.front(); }
 

@@ -14,8 +14,9 @@
 
 namespace brenvik {
 
-// One datagram at a time, with everything that came with it, in memory made once. Descriptors, mappings and
-// rights that nobody took over are released by release() or by the next receive(). Main loop only.
+// Receives one datagram at a time, with everything that came with it, into memory that is allocated once.
+// release() or the next receive() releases the descriptors, mappings and rights that nobody took over. Main
+// loop only.
 class IncomingMessage {
  public:
   enum class Received { message, nothing, endOfChannel };
@@ -25,27 +26,26 @@ class IncomingMessage {
   IncomingMessage(const IncomingMessage&) = delete;
   IncomingMessage& operator=(const IncomingMessage&) = delete;
 
-  // Takes the next datagram of a socket, without waiting: one system call.
+  // Takes the next datagram of a socket without waiting; makes one system call.
   Received receive(int fd) noexcept;
 
-  // As receive, for a stranger's message: it stays in the socket until taken(), and of its descriptors no
-  // more than one is received. What is not a message of at most one port is refused by checkForm() and
-  // unpack().
+  // Like receive(), for a stranger's message: it stays in the socket until take(), and at most one of its
+  // descriptors is received. checkForm() and unpack() refuse any message but one with at most one port.
   Received peek(int fd, ClosingLine::Account account) noexcept;
-  // Takes the message that was peeked at off the socket. False when that would drop descriptors that nobody
-  // else holds: it is still there then, and a thread that may wait must take it (ClosingLine).
+  // Takes the message that was peeked at off the socket. Returns false if that would close descriptors that
+  // nobody else holds: the message then stays, and a thread that may block must take it (ClosingLine).
   bool take(int fd) noexcept;
 
-  // Long enough to be looked at; a shorter datagram is dropped without an answer.
+  // Whether the datagram is long enough for a header; a shorter one is dropped without an answer.
   bool hasHeader() const noexcept { return length_ >= sizeof(MessageHeader); }
 
-  // Whether the framing is right, and as many descriptors came as it asks for. Looks at nothing else.
-  // Precondition: hasHeader().
+  // Returns kern::success if the framing is right and the number of descriptors that came matches it, else a
+  // code of the message layer. Looks at nothing else. Precondition: hasHeader().
   KernelReturn checkForm() const noexcept;
 
-  // Checks the form, maps what travels as a memfd, gives names to the rights and writes both into the
-  // message, with its size and `localPort`. A code of the message layer when no correct sender makes such a
-  // datagram, one of the kernel when this process lacks what it takes; the header is as sent then.
+  // Checks the form, maps regions that travel as a memfd, gives names to the rights, and writes both into the
+  // message, with its size and `localPort`. Returns a code of the message layer if the datagram is malformed,
+  // or a kernel code if this process lacks memory or descriptors; the header then stays as it was sent.
   // Precondition: hasHeader().
   KernelReturn unpack(PortName localPort) noexcept;
 
@@ -55,21 +55,22 @@ class IncomingMessage {
     return *reinterpret_cast<const MessageHeader*>(storage_.bytes.data());
   }
 
-  // What the kernel says of the sender; nothing where the socket does not ask for it.
+  // The sender's credentials from the kernel; nothing if the socket does not ask for them.
   const std::optional<ucred>& sender() const noexcept { return sender_; }
 
-  // Ends the message: regions are unmapped; rights are kept when the routine took them over.
+  // Ends the message: unmaps its regions, and releases its rights unless the routine took them over
+  // (`keepRights`).
   void release(bool keepRights) noexcept;
 
  private:
-  // For one right: CMSG_SPACE would leave room for two.
+  // Room for exactly one right; CMSG_SPACE would leave room for two.
   static constexpr std::size_t kControlRoomOfAStranger = CMSG_SPACE(sizeof(ucred)) + CMSG_LEN(sizeof(int));
 
   struct Mapping {
     void* address;
     std::size_t length;
   };
-  // Whether it is nothing but its bytes, as most are: then there is nothing to be walked.
+  // Whether the message is nothing but its bytes, as most are. Then there are no descriptors to walk.
   bool isPlain() const noexcept {
     return (header().bits & kComplexBit) == 0 && fdCount_ == 0 && !descriptorsCut_;
   }
@@ -89,7 +90,8 @@ class IncomingMessage {
   std::size_t nameCount_ = 0;
   std::array<UniqueFd, kMaxDatagramDescriptors> fds_;
   std::array<PortName, kMaxDatagramDescriptors> names_;
-  // The control data first: it shares the pages of the above. The mappings last: a check-in has none.
+  // The control data comes first, because it shares pages with the members above. The mappings come last,
+  // because a check-in has none.
   struct Storage {
     ControlRoom<kMaxDatagramDescriptors> control;
     alignas(16) std::array<std::byte, kLargestDatagram> bytes;

@@ -11,16 +11,16 @@
 
 namespace brenvik {
 
-// The trailer of a message from what the kernel attached to it, and from /proc for what the credentials do
-// not say. A sender that has gone by now has pid version 0.
+// Builds the trailer of a message from the credentials that the kernel attached, and from /proc for the rest.
+// A sender that has already exited gets pid version 0.
 MessageTrailer buildTrailer(const ucred& sender, std::uint32_t sequence) noexcept;
 
-// The trailer of a message nobody asked a trailer for: type and size only.
+// The trailer for a routine that needs none: type and size only.
 MessageTrailer minimalTrailer() noexcept;
 
-// Whether the process that sent a message is the one that made the connection, where the kernel can say
-// (SO_PEERPIDFD, Linux 6.5): `unsupported` where it cannot, `refused` when it names another process or one
-// that has gone. `peer` is the connection's (SO_PEERCRED).
+// Whether the process that sent a message is the one that made the connection. `unsupported` if the kernel
+// cannot tell (it needs SO_PEERPIDFD, Linux 6.5); `refused` if the connection's process is another one or has
+// exited. `peer` has the connection's credentials (SO_PEERCRED).
 enum class PeerPin { confirmed, unsupported, refused };
 PeerPin pinPeer(int connection, pid_t peer, pid_t sender) noexcept;
 

@@ -10,30 +10,29 @@
 
 namespace brenvik {
 
-// How often an account may be refused: each refusal costs the main loop a look at the caller and at the
-// entitlement files. An account beyond its limit is not refused faster, it waits.
+// Limits how often an account is refused, because each refusal makes the main loop examine the caller and the
+// entitlement files. An account beyond its limit waits for its refusals.
 class RefusalLimit {
  public:
   using Time = std::chrono::steady_clock::time_point;
 
-  // More than a person or a script causes by accident; what is left of the processor for others stays above
-  // 99 %.
+  // More than a person or a script causes by accident, and still less than 1 % of the processor's time.
   static constexpr int kBurst = 50;
   static constexpr std::chrono::milliseconds kOneMoreEvery{50};
 
-  // Whether a check-in of the account may be looked at now.
+  // Whether a check-in of the account may be examined now.
   bool allows(uid_t account, Time now) const noexcept;
-  // One was refused.
+  // Records that a check-in of the account was refused.
   void refused(uid_t account, Time now) noexcept;
 
   std::size_t accounts() const noexcept { return paidUntil_.size(); }
 
  private:
-  // Accounts remembered: more than a machine has that may connect. Beyond it, those are forgotten that
-  // have been quiet long enough.
+  // The most accounts remembered; a machine has fewer that may connect. Beyond it, accounts that have been
+  // quiet long enough are forgotten.
   static constexpr std::size_t kMaxAccounts = 1024;
 
-  // When the last refusal will have been paid for, at one in kOneMoreEvery.
+  // When each account's refusals are paid off, at one refusal every kOneMoreEvery.
   std::unordered_map<uid_t, Time> paidUntil_;
 };
 

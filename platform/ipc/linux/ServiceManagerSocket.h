@@ -6,9 +6,9 @@
 
 namespace brenvik {
 
-// The listening SOCK_SEQPACKET socket of this name that the service manager started this process with;
-// invalid when there is none. Once: the variables that tell of it are gone afterwards, and descriptors under
-// other names are closed. May throw std::bad_alloc.
+// Returns the listening SOCK_SEQPACKET socket of this name that the service manager passed to this process;
+// invalid if there is none. Works once: it removes the environment variables that describe the sockets and
+// closes the descriptors with other names. Throws std::bad_alloc.
 UniqueFd takeServiceManagerSocket(const char* serviceName);
 
 }  // namespace brenvik

@@ -12,22 +12,22 @@
 
 namespace brenvik {
 
-// A socket beside the service's, at which whoever may connect to the service is told one text: each
-// connection gets one datagram and is closed. A connection is no client and holds nothing: it is over before
-// the loop goes on, whether its maker reads or not. What an account may ask in a while is limited; beyond
-// that its connections are closed without a word, and accepting pauses for a moment. Main loop only.
+// A socket beside the service's, open to everyone who may connect to the service. Each connection gets one
+// text in one datagram and is closed at once, whether the peer reads or not; it is not a client and keeps
+// nothing alive. Each account's rate is limited; connections beyond it are closed without an answer, and
+// accepting pauses for a moment. Main loop only.
 class StatusSocket {
  public:
   using Now = std::function<RefusalLimit::Time()>;
 
-  // Listens at `servicePath` and kStatusSocketSuffix, mode 0660, with the service socket's group; a socket
-  // file that stands there is replaced. `answer` makes the text; it may throw std::bad_alloc. Null, and a
-  // line says why, when that cannot be done. What is given outlives the result.
+  // Listens at `servicePath` plus kStatusSocketSuffix, mode 0660, with the service socket's group; replaces a
+  // socket file that is already there. `answer` makes the text; it may throw std::bad_alloc. Returns null and
+  // logs the reason if the socket cannot be made. The arguments must outlive the result.
   static std::unique_ptr<StatusSocket> make(SystemPortSpace& ports, RunLoop& loop,
                                             const std::string& servicePath,
                                             std::function<std::string()> answer,
                                             Now now = std::chrono::steady_clock::now);
-  // Removes the file, if it is still this socket's.
+  // Removes the socket file if it still belongs to this socket.
   ~StatusSocket();
   StatusSocket(const StatusSocket&) = delete;
   StatusSocket& operator=(const StatusSocket&) = delete;
@@ -49,7 +49,7 @@ class StatusSocket {
   const std::function<std::string()> answer_;
   const Now now_;
   RefusalLimit limit_;
-  unsigned long long inode_ = 0;  // of the file; 0: there is none of ours
+  unsigned long long inode_ = 0;  // of the socket file; 0: we have made none
   SystemPortSpace::SharedFd listening_;
   std::unique_ptr<DescriptorSource> source_;
   std::unique_ptr<LoopSource> tick_;  // while accepting pauses

@@ -8,14 +8,14 @@
 
 namespace brenvik {
 
-// Named services as socket files in one directory. A service that the service manager already listens for
-// (sd_listen_fds(3), a descriptor named after the service) is taken over, and its file is the manager's; else
-// the directory (mode 0755) and the socket (mode 0660, root's and the group's) are made here, a stale file is
-// replaced, and a file behind which somebody listens is refused. Main thread only.
+// Named services as socket files in one directory. If the service manager already listens for a service
+// (sd_listen_fds(3), a descriptor named after the service), its socket is used and the file stays the
+// manager's. Otherwise this class makes the directory (mode 0755) and the socket (mode 0660, owned by root
+// and the group). It replaces a stale socket file and fails if somebody listens there. Main thread only.
 class SystemBootstrap final : public Bootstrap {
  public:
-  // `group`: who may connect; root's group where there is none of that name, and unless root makes the
-  // socket.
+  // `group`: the group that may connect; root's group if there is no group of that name. Only root can set
+  // it.
   SystemBootstrap(SystemPortSpace& ports, std::string directory, std::string group)
       : ports_(ports), directory_(std::move(directory)), group_(std::move(group)) {}
 

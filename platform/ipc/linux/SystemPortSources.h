@@ -13,17 +13,17 @@ namespace brenvik {
 
 // Routine sources and death watches on the ports of a SystemPortSpace.
 //
-// A source takes further messages of a channel without another wake-up only while the sender does not wait
-// for answers, and never more than a small budget in a row. A reply that does not fit its channel waits for
-// room, and nothing more is read from that channel until it has gone out; others do not notice. Of a
-// service's connections that have not checked in, only so many are kept, of one account and in all, and the
-// oldest goes first. What they send is never mapped, and descriptors of theirs are closed elsewhere.
+// A source reads several messages of a channel in one wake-up only if the sender does not wait for answers,
+// and never more than a small budget. If a reply does not fit its channel, nothing more is read from that
+// channel until the reply has gone out; other channels are not delayed. The number of connections that have
+// not checked in is limited, per account and in total; the oldest is closed first. Their regions are never
+// mapped, and their descriptors are closed on another thread.
 class SystemPortSources final : public PortSources {
  public:
-  // Whether an account that is refused again and again waits for its answers. Without it: for fuzzing.
+  // `limited`: an account that is refused again and again waits for its answers. `unlimited` is for fuzzing.
   enum class Refusals { limited, unlimited };
 
-  // Both outlive this object and everything it makes.
+  // `ports` and `regions` must outlive this object and everything it makes.
   SystemPortSources(SystemPortSpace& ports, SystemRegions& regions, Refusals refusals = Refusals::limited);
   ~SystemPortSources() override;
 
@@ -35,7 +35,7 @@ class SystemPortSources final : public PortSources {
   SystemPortSpace& ports_;
   SystemRegions& regions_;
   const Refusals refusals_;
-  // One message at a time is served in the whole process, so one buffer serves every channel.
+  // The process serves one message at a time, so all channels share one buffer.
   IncomingMessage incoming_;
 };
 

@@ -12,21 +12,20 @@
 
 namespace brenvik {
 
-// Regions for replies. One that fits a datagram beside its message is plain memory, with room in front for
-// the message, so that both go out as one piece (the last one freed is kept for the next); a larger one is
-// written straight into a memfd (memfd_create(2)) that will travel as it is.
+// Allocates regions for replies. A region that fits a datagram beside its message is plain memory with room
+// in front for the message, so that both are sent as one piece; the last one freed is kept for the next. A
+// larger region is a mapped memfd (memfd_create(2)), which is sent as it is. Main loop only.
 class SystemRegions final : public RegionAllocator {
  public:
-  // Longest region that travels in the same datagram as an out-of-line reply, in bytes.
+  // Room for the reply's message in front of an in-line region, in bytes.
   static constexpr std::size_t kRoomForMessage = 56;
   static constexpr std::size_t kLongestInLine = kLargestDatagram - kRoomForMessage;
 
   KernelReturn allocate(void** address, std::size_t length) noexcept override;
   void deallocate(void* address, std::size_t length) noexcept override;
 
-  // For a region longer than kLongestInLine: takes its mapping away and returns its memfd, sealed against
-  // shrinking, growing and writing. An invalid descriptor when the kernel refused; the region is gone either
-  // way.
+  // For a region longer than kLongestInLine: unmaps it and returns its memfd, sealed against shrinking,
+  // growing and writing. Returns an invalid descriptor if the kernel refuses. Either way, the region is gone.
   UniqueFd sealIntoDescriptor(void* address, std::size_t length) noexcept;
 
   std::size_t live() const noexcept { return liveSmall_ + large_.size(); }

@@ -11,8 +11,8 @@
 
 namespace brenvik {
 
-// A labeler that knows no language: it keeps what it was asked and answers each text with the text itself, or
-// the whole call with the answer it was given.
+// A labeler without languages. It records its arguments and returns the texts themselves, or the answer that
+// the test has set.
 class RecordingLabeler final : public SubscriptionLabeler {
  public:
   struct Call {

@@ -39,19 +39,19 @@ extern const ServedTag kServedTags[];  // in the order of their tags
 
 }  // namespace catalogue
 
-// One language's labels. A value to be copied; what it gives lives as long as the program. Any thread.
+// One language's labels. Cheap to copy; returned texts live as long as the program. Any thread.
 class LabelCatalogue {
  public:
-  // The catalogue for one language range by RFC 4647 lookup (section 3.4): the range is shortened subtag by
-  // subtag until a catalogue serves it. Case does not matter and '_' counts as '-'. Null when none does, and
-  // for "*" and malformed ranges.
+  // Finds the catalogue for one language range by RFC 4647 lookup (section 3.4), which shortens the range
+  // subtag by subtag until a catalogue serves it. Ignores case; '_' counts as '-'. Returns null if no
+  // catalogue serves it, and for "*" and malformed ranges.
   static const catalogue::Catalogue* find(std::string_view range) noexcept;
 
   // English, for a request none of whose languages is served.
   LabelCatalogue() noexcept : tables_(&catalogue::kCatalogues[catalogue::kFallbackCatalogue]) {}
   explicit LabelCatalogue(const catalogue::Catalogue& tables) noexcept : tables_(&tables) {}
 
-  // Its ISO 639 code, NUL-terminated: decides the rules of upper-casing.
+  // Its ISO 639 code, NUL-terminated, which decides the rules for upper case.
   const char* language() const noexcept { return tables_->language; }
   std::string_view text(Label label) const noexcept {
     const catalogue::Text& text = tables_->texts[static_cast<std::size_t>(label)];

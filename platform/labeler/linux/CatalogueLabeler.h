@@ -6,7 +6,7 @@
 
 namespace brenvik {
 
-// The labeler on the catalogues compiled into the program. It has no state: making one costs nothing.
+// The labeler that uses the catalogues compiled into the program. It has no state; making one costs nothing.
 class CatalogueLabeler final : public SubscriptionLabeler {
  public:
   PropertyList localizedBadgeLabels(const PropertyList& labels, const PropertyList& languages) override;

@@ -13,8 +13,8 @@
 
 namespace brenvik {
 
-// Records every line with its channel and level while it lives, then puts the previous sink back.
-// Any thread may log; read the lines when the work under test has ended.
+// Records every line with its channel and level while it lives; its destructor puts the previous sink back.
+// Any thread may log; read the lines after the work under test has ended.
 class RecordingLog final : public LogSink {
  public:
   struct Entry {
@@ -75,7 +75,7 @@ class RecordingLog final : public LogSink {
   std::vector<std::map<std::string, std::string>> fields_;
 };
 
-// So that a failed assertion shows the line and not its bytes.
+// Makes a failed assertion show the line instead of its bytes.
 inline void PrintTo(const RecordingLog::Entry& entry, std::ostream* out) {
   *out << (entry.channel == RecordingLog::Entry::Channel::unified ? "unified" : "bsd") << "/" << entry.level
        << " \"" << entry.line << "\"";

@@ -11,27 +11,28 @@
 
 namespace brenvik {
 
-// One field of a journal entry. A name is of A to Z, 0 to 9 and underscores; a value may hold any bytes.
+// One field of a journal entry. A name consists of A to Z, 0 to 9 and underscores; a value may hold any
+// bytes.
 struct JournalField {
   std::string_view name;
   std::string_view value;
 };
 
-// The sending end of the journal's native protocol: one datagram an entry, or, when that is too large for
-// one, a datagram that carries nothing but a sealed memfd with the same bytes. Any thread; allocates nothing.
+// The sending end of the journal's native protocol: one datagram for each entry. If the entry is too large,
+// the datagram carries only a sealed memfd with the same bytes. Any thread; allocates nothing.
 class Journal {
  public:
   static constexpr const char* kSocket = "/run/systemd/journal/socket";
   static constexpr std::size_t kMaxFields = 16;
 
-  // `path` is copied; it fits a socket address.
+  // `path` is copied; it must fit a socket address.
   explicit Journal(const char* path = kSocket) noexcept;
   ~Journal();
   Journal(const Journal&) = delete;
   Journal& operator=(const Journal&) = delete;
 
-  // False when there is no journal, or one that took nothing for a tenth of a second. One that has kept
-  // somebody waiting is not waited for again before it has taken an entry.
+  // Returns false if there is no journal, or if it accepted nothing for a tenth of a second. After such a
+  // wait, send() does not wait again until the journal has accepted an entry.
   bool send(std::span<const JournalField> fields) noexcept;
 
  private:

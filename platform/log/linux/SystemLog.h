@@ -7,16 +7,16 @@
 
 namespace brenvik {
 
-// The unified log on the journal (Journal.h), or on standard error with the <N> priority prefix of
-// sd-daemon(3) while there is none; the BSD log on syslog(3), facility daemon. Lines are escaped
-// (EscapedLine.h), one trailing newline of a BSD line is dropped. Any thread.
+// Writes the unified log to the journal (Journal.h), or, while there is none, to standard error with the <N>
+// priority prefix of sd-daemon(3); the BSD log to syslog(3), facility daemon. Lines are escaped
+// (EscapedLine.h); one trailing newline of a BSD line is dropped. Any thread.
 //
 // Every journal entry has the MESSAGE_ID of its text, and the fields of the request it belongs to
-// (LogContext.h). syslog(3) cannot carry one: where /dev/log is the journal's own socket, the BSD log's lines
-// are handed to it natively, with the same identifier, priority and facility.
+// (LogContext.h). syslog(3) cannot carry these fields: if /dev/log is the journal's own socket, the BSD log's
+// lines are sent by the journal's protocol, with the same identifier, priority and facility.
 class SystemLog final : public LogSink {
  public:
-  // `identifier` is kept, not copied: a string literal.
+  // `identifier` is not copied; pass a string literal.
   explicit SystemLog(const char* identifier) noexcept;
   ~SystemLog() override;
   SystemLog(const SystemLog&) = delete;

@@ -12,7 +12,7 @@
 
 namespace brenvik {
 
-// Keeps every message sent to any name; or, when told, has nobody listening.
+// Records every message sent to any name; can also act as if nobody listened.
 class RecordingMessagePorts final : public MessagePorts {
  public:
   struct Message {

@@ -9,8 +9,8 @@
 namespace brenvik {
 
 // Ports that are named services of the bootstrap directory: sequenced-packet sockets (unix(7)). Each message
-// is one datagram: a message header with no reply port, then the data; one of more than kLargestDatagram
-// bytes in all is dropped.
+// is one datagram: a message header with no reply port, then the data. A datagram of more than
+// kLargestDatagram bytes is dropped.
 class ChannelMessagePorts final : public MessagePorts {
  public:
   explicit ChannelMessagePorts(std::string bootstrapDirectory) : directory_(std::move(bootstrapDirectory)) {}

@@ -9,28 +9,28 @@
 
 namespace brenvik {
 
-// Files the rule reads.
+// The files that the rule reads.
 struct CellularRuleFiles {
   std::string interfaces = "/sys/class/net";
   std::string nameServers = "/etc/resolv.conf";
   std::string hosts = "/etc/hosts";
 };
 
-// True for an interface whose packets cost: named pdp_ip*, or of the kernel's device type "wwan".
+// True for an interface whose packets cost money: named pdp_ip*, or of the kernel's device type "wwan".
 bool isCellularInterface(std::string_view name, const CellularRuleFiles& files = {}) noexcept;
 
-// How a connection to a peer would go.
+// The route of a connection to a peer.
 struct ConnectionWay {
-  enum class Kind { open, cellular, none };  // none: no route, or it cannot be told
+  enum class Kind { open, cellular, none };  // none: no route, or it cannot be found out
   Kind kind = Kind::none;
-  // With `open`, the interface. A socket bound to it (SO_BINDTODEVICE) cannot stray when routes change.
+  // With `open`, the interface. A socket bound to it (SO_BINDTODEVICE) stays there even if routes change.
   std::string interfaceName;
 };
 ConnectionWay routeTo(const sockaddr& peer, const CellularRuleFiles& files = {}) noexcept;
 
-// Whether looking up the name may be tried without a packet leaving by a cellular interface: some route that
-// leads further than the link is not cellular, or there is no route at all; and every name server is reached
-// without a cellular interface, unless the hosts file has the name.
+// Whether the name can be looked up without sending a packet over a cellular interface. That is so if some
+// route beyond the link is not cellular, or there is no route at all; and if every name server is reached
+// without a cellular interface, or the hosts file has the name.
 bool mayLookUpName(std::string_view host, const CellularRuleFiles& files = {}) noexcept;
 
 }  // namespace brenvik

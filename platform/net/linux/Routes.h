@@ -10,15 +10,15 @@
 
 namespace brenvik {
 
-// Questions to the kernel's routing, see rtnetlink(7). Each opens a socket of its own. Any thread. Both
-// throw std::bad_alloc.
+// These functions ask the kernel about routes, see rtnetlink(7). Each opens a socket of its own. Any thread.
+// Both throw std::bad_alloc.
 
-// Index of the interface that a packet to `peer` (AF_INET or AF_INET6) would leave by. Nothing when there is
-// no route, the family is another one or the kernel did not answer.
+// Returns the index of the interface for packets to `peer` (AF_INET or AF_INET6). Returns nothing if there is
+// no route, the family is another one, or the kernel did not answer.
 std::optional<unsigned> interfaceTo(const sockaddr& peer);
 
-// The interfaces of all unicast routes that lead further than the link, of every table; the loopback
-// interface, link-local destinations and dead next hops left out. Nothing when the kernel did not answer.
+// Returns the interfaces of all unicast routes beyond the link, in every table, without the loopback
+// interface, link-local destinations and dead next hops. Returns nothing if the kernel did not answer.
 std::optional<std::set<unsigned>> interfacesWithRoutes();
 
 }  // namespace brenvik

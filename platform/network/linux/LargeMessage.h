@@ -13,19 +13,19 @@
 
 namespace brenvik {
 
-// The longest payload of a message that need not fit a datagram: an answer's header fields have 256 KiB, and
-// an address with every part as long as it may be stays below, too.
+// The longest payload, in bytes, of a message that need not fit a datagram. An answer's header fields have at
+// most 256 KiB, and the longest address is shorter, too.
 inline constexpr std::size_t kLongestLargePayload = std::size_t{1} << 20;
 
-// A message whose payload travels in sealed memory where it is too long for a datagram. Throws
-// std::bad_alloc, also where there are no descriptors.
+// Makes a message whose payload travels in sealed memory if it is too long for a datagram. Throws
+// std::bad_alloc, also if there are no descriptors left.
 WorkerMessage packLarge(std::uint32_t kind, std::vector<std::byte> payload,
                         std::vector<UniqueFd> descriptors = {});
 
-// What packLarge() made, read again; the descriptors are the message's others.
+// Reads a message that packLarge() made, and holds its other descriptors.
 class LargePayload {
  public:
-  // Nothing when it has not that form.
+  // Returns nothing if the message is malformed.
   static std::optional<LargePayload> open(WorkerMessage message) noexcept;
 
   std::span<const std::byte> bytes() const noexcept;

@@ -24,7 +24,7 @@ constexpr const char kQueueLabel[] = "network worker";
 constexpr int kMaxSignsOfLife = 60;
 constexpr auto kTimerLeeway = milliseconds(100);
 
-// What comes along with an answer is sealed memory; of anything else the last close could wait for ever.
+// An answer's descriptors must be sealed memory; the last close of any other descriptor could block for ever.
 bool isSealedMemory(const UniqueFd& descriptor) noexcept { return sizeOfSealedMemory(descriptor.get()) >= 0; }
 
 struct Question {
@@ -89,7 +89,7 @@ class NetworkAnswers::Desk : public std::enable_shared_from_this<Desk> {
       used = used_;
     }
     if (queue == nullptr || !used) return;
-    // Whoever waits for an answer waits until this is done, so it is, however long memory is short.
+    // Callers wait until this has run, so it must run even if memory is short for a while.
     runAndWait(*queue, [this] { abandonAll(); });
   }
 

@@ -10,16 +10,16 @@
 namespace brenvik {
 
 // The network of a prober, in the network worker; the clocks are this process's. The caller's thread waits
-// for each answer, but not for a worker that has died or hangs: what it asks then fails.
+// for each answer. If the worker has died or hangs, the call fails.
 class RemoteEchoNetwork final : public EchoNetwork {
  public:
-  // How long an answer that takes no time may take, the worker's start included; and beyond its own time-out
-  // one that does.
+  // The time limit of an answer that needs no waiting, the worker's start included; a receive may take this
+  // long beyond its own time-out.
   static constexpr std::chrono::milliseconds kPatience = std::chrono::seconds(3);
   // A name server that does not answer is given up by the C library after ten seconds.
   static constexpr std::chrono::milliseconds kLookUpPatience = std::chrono::seconds(12);
 
-  // The worker outlives it.
+  // The worker must outlive it.
   explicit RemoteEchoNetwork(Worker& worker, std::chrono::milliseconds patience = kPatience) noexcept
       : worker_(worker), patience_(patience) {}
 

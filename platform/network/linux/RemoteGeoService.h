@@ -12,11 +12,11 @@
 
 namespace brenvik {
 
-// The geo service, in the network worker; the country configuration, and the country of the last answer, are
-// kept here. A question to which the worker gives no answer ends in an error.
+// The geo service, in the network worker. The country configuration, and the country of the last answer, are
+// kept in this process. A question that the worker does not answer ends in an error.
 class RemoteGeoService final : public GeoService {
  public:
-  // The answers outlive it, or have been shut down. Cheap: opens nothing.
+  // The answers must outlive it or be shut down first. Cheap: opens nothing.
   RemoteGeoService(NetworkAnswers& answers, CountryConfiguration::Files countryFiles);
 
   std::unique_ptr<ReverseGeocodeTicket> makeReverseGeocodeTicket(Coordinate coordinate, IncludeEta includeEta,

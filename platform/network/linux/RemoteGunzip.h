@@ -12,17 +12,17 @@
 
 namespace brenvik {
 
-// Gunzip, in the network worker, which is handed the file. The caller's thread waits, as long as the worker
-// says now and then that it is at work.
+// Gunzip in the network worker, which gets the file's descriptor. The caller's thread waits as long as the
+// worker sends signs of life.
 class RemoteGunzip final : public Gunzip {
  public:
-  // The worker outlives it.
+  // The worker must outlive it.
   explicit RemoteGunzip(Worker& worker, std::chrono::milliseconds longestSilence = kLongestSilence) noexcept;
 
   GunzipOutcome gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
                            std::uint64_t largestOutput) noexcept override;
 
-  // Ends what is under way, and from now on everything at once, as unavailable. Any thread.
+  // Ends the work under way as `unavailable`; later calls end so at once. Any thread.
   void shutDown() noexcept;
 
  private:

@@ -9,15 +9,15 @@
 
 namespace brenvik {
 
-// The HTTP client, in the network worker. A request to which the worker gives no answer completes as
-// clientUnavailable, at the latest after the longest silence; one under way when the answers are shut down as
-// cancelled.
+// The HTTP client, in the network worker. A request that the worker does not answer completes as
+// clientUnavailable, at the latest after the longest silence. A request under way when the answers are shut
+// down completes as cancelled.
 class RemoteWebClient final : public WebClient {
  public:
-  // The longest URL: with it, a request fits one datagram.
+  // The longest URL, in bytes; with it, a request still fits one datagram.
   static constexpr std::size_t kLongestUrl = std::size_t{32} << 10;
 
-  // The answers outlive it.
+  // The answers must outlive it.
   explicit RemoteWebClient(NetworkAnswers& answers) noexcept : answers_(answers) {}
 
   std::shared_ptr<WebSession> makeSession() override;

@@ -17,7 +17,7 @@
 
 namespace brenvik {
 
-// Where a domain's file is, and what is made for it when it is missing.
+// The place of a domain's file, and the folders that are made for it.
 struct DomainPlace {
   std::string root;    // exists, or nothing can be stored
   std::string folder;  // below root, relative
@@ -28,7 +28,7 @@ struct DomainPlace {
   std::string path() const { return root + "/" + folder + "/" + name; }
 };
 
-// What tells one state of a file from another.
+// Tells one state of a file from another.
 struct FileStamp {
   dev_t device = 0;
   ino_t inode = 0;
@@ -38,21 +38,21 @@ struct FileStamp {
   bool operator==(const FileStamp&) const = default;
 };
 
-// The exclusive right of writing in one folder, shared by all writers of preferences on this machine; gone
-// with the object. What holds it is an open-file lock on a file of its own, which stays.
+// The exclusive right to write in one folder, for all writers of preferences on this machine. The destructor
+// gives it up. It is a lock on a separate file, which stays.
 class FolderLock {
  public:
   FolderLock() = default;
   bool isHeld() const noexcept { return file_.isValid(); }
-  // 0, or an errno; EWOULDBLOCK when others kept it for as long as `patience`.
+  // Returns 0 or an errno; EWOULDBLOCK if others held it for all of `patience`.
   int take(int folder, std::chrono::milliseconds patience) noexcept;
 
  private:
   UniqueFd file_;
 };
 
-// The file of one domain: reads it whole, replaces it whole. Every failure is logged here, once. Not for
-// several threads at once. May throw std::bad_alloc.
+// The file of one domain, which is read and replaced as a whole. It logs every failure, once. One thread at a
+// time. May throw std::bad_alloc.
 class DomainFile {
  public:
   explicit DomainFile(DomainPlace place) : place_(std::move(place)), path_(place_.path()) {}
@@ -62,7 +62,7 @@ class DomainFile {
   enum class State {
     absent,
     read,
-    unavailable,  // perhaps there is something that must not be written over
+    unavailable,  // there may be a file that must not be overwritten
   };
   struct Loaded {
     State state = State::absent;
@@ -70,22 +70,22 @@ class DomainFile {
     FileStamp stamp;
     // Keeps the inode's number from being given to another file as long as the stamp is compared.
     UniqueFd pin;
-    // False: so young that it could change once more within the file system's clock tick.
+    // False: the file is so new that it could change again within the same tick of the file system's clock.
     bool isSettled = true;
   };
-  // Reads the file. A damaged or unreadable one is moved aside, which needs the lock: when `held` does not
-  // hold it, it is taken for as long as that takes.
+  // Reads the file. Moves a damaged or unreadable file aside, under the lock, which it takes for that time if
+  // `held` does not hold it.
   Loaded load(std::chrono::milliseconds patience, const FolderLock* held);
 
-  // The stamp of what stands there now; links are followed.
+  // The stamp of the file that is there now; links are followed.
   FileStamp stamp() const noexcept;
 
   // Opens the folder, with everything missing below the root made durably. Invalid on failure.
   UniqueFd openFolder() const noexcept;
   bool lock(int folder, std::chrono::milliseconds patience, FolderLock& lock) const noexcept;
 
-  // Puts a new file in the old one's place, durable when this returns true. On failure the old one stands,
-  // unless only the folder could not be synced any more. With the lock held.
+  // Replaces the old file with a new one, which is durable when this returns true. On failure the old file
+  // stays, unless only syncing the folder failed. The caller must hold the lock.
   bool replace(int folder, std::span<const std::string_view> content, FileStamp& stamp,
                UniqueFd& pin) const noexcept;
 

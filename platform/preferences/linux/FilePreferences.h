@@ -16,35 +16,35 @@ namespace brenvik {
 
 struct DomainPlace;
 
-// Preferences in files: one binary property list a domain (one in XML is read as well), written whole to a
-// temporary file, synced, renamed and the folder synced, under a lock that all writers of a folder share.
+// Preferences in files: one binary property list for each domain (XML is read as well). It writes a temporary
+// file, syncs it, renames it and syncs the folder, under a lock that all writers of a folder share.
 //
 //   current user, any host      <home>/Library/Preferences/<domain>.plist
 //   current user, current host  <home>/Library/Preferences/ByHost/<domain>.<machine id>.plist
 //   any user, any host          <any user>/<domain>.plist
 //   any user, current host      <any user>/ByHost/<domain>.<machine id>.plist
 //
-// Only the keys that were set are written: what others put under other keys meanwhile stays. A file that is
-// damaged or cannot be read is moved aside beside itself and logged, never written over.
+// Only the keys that were set are written; other keys that others have changed meanwhile stay. A file that is
+// damaged or cannot be read is renamed within its folder and logged, never overwritten.
 //
-// Any thread; a domain is used by one at a time, and synchronize() holds it for as long as the disk takes.
+// Any thread; one thread at a time uses a domain, and synchronize() keeps it for as long as the disk takes.
 class FilePreferences final : public PreferencesStore {
  public:
   struct Places {
     std::string home;       // of the user whose preferences these are; empty: none is known
     std::string anyUser;    // absolute
-    std::string machineId;  // empty: none is known, so that nothing can be kept for the current host
+    std::string machineId;  // empty: unknown, so nothing can be kept for the current host
     int homeError = 0;      // errno of a look-up that failed; 0: there is none
     int machineIdError = 0;
   };
   // The effective user's home directory, the folder compiled in, and /etc/machine-id. Throws std::bad_alloc.
   static Places systemPlaces();
 
-  // How long a writer waits for others that write in the same folder, before it gives up.
+  // How long a writer waits for other writers in the same folder.
   static constexpr std::chrono::milliseconds kPatience{1000};
 
-  // `places` is asked when the first domain is used, and again by each operation that needs a place that is
-  // not known: a look-up may fail at one moment and succeed at the next.
+  // `places` is called when the first domain is used, and again for each operation that needs an unknown
+  // place, because a look-up may fail at one moment and succeed later.
   explicit FilePreferences(std::function<Places()> places = systemPlaces,
                            std::chrono::milliseconds patience = kPatience);
   FilePreferences(const FilePreferences&) = delete;
@@ -66,8 +66,8 @@ class FilePreferences final : public PreferencesStore {
   void lookUpPlaces(UserScope user, HostScope host);
   std::optional<DomainPlace> placeOf(std::string_view domain, UserScope user, HostScope host);
   void logNothingStored(std::string_view domain, UserScope user, HostScope host);
-  // Null when the domain names no file there. May throw std::bad_alloc, but not for a domain that is known:
-  // what was set there can always be stored or dropped.
+  // Returns null if the domain does not name a file there. May throw std::bad_alloc, but not for a domain
+  // already in the list, so that its changes can always be stored or dropped.
   std::shared_ptr<Domain> find(std::string_view domain, UserScope user, HostScope host);
 
   const std::function<Places()> askForPlaces_;

@@ -6,16 +6,17 @@
 
 namespace brenvik {
 
-// The functions of sd-bus(3) that are used here. The library is loaded (dlopen(3)) by the first load(), and
-// stays in the process: it brings six others along, which a process that never speaks to a bus need not have.
-// One thread at a time.
+// The functions of sd-bus(3) that are used here. The first load() loads the library with dlopen(3), and it
+// stays in the process. It depends on six others, which a process that never uses a bus does not need. One
+// thread at a time.
 class SdBus {
  public:
-  // `library` is kept, not copied.
+  // `library` is not copied; it must outlive the object.
   explicit SdBus(const char* library) noexcept : library_(library) {}
 
-  // False when the library or one of its functions cannot be loaded: then none may be called. The next call
-  // looks again, since only memory or descriptors may have been missing. Reads files: not on the main loop.
+  // Returns false if the library or one of its functions cannot be loaded; then call none of them. The next
+  // call tries again, since the cause may have been a lack of memory or descriptors. Reads files: not on the
+  // main loop.
   bool load() noexcept;
 
   decltype(&::sd_bus_new) create = nullptr;

@@ -16,50 +16,51 @@
 
 namespace brenvik {
 
-// One thread's loop with an inbox that any thread may post to; what the main run loop and every work queue
-// stand on. It wakes for its sources and its inbox and for nothing else. All of them are in one epoll(7) set:
-// the watched descriptors, an eventfd for the inbox and one timerfd for all timers, which is set to the first
-// of them before the loop waits.
+// One thread's loop, with an inbox that any thread may post to. The main run loop and every work queue are
+// built on it. It wakes only for its sources and its inbox. One epoll(7) set holds the watched descriptors,
+// an eventfd for the inbox and one timerfd for all timers, which is set to the earliest timer before the loop
+// waits.
 //
 // The thread that calls runOnce() is the loop's thread.
 class EventLoop : public std::enable_shared_from_this<EventLoop> {
  public:
-  // Which thread owns the loop before its first runOnce(): the one that makes it, or one to be started. A
-  // loop for another thread takes all the descriptors that it needs for itself at once; this thread's takes
-  // the last of them, the clock's, with its first timer.
+  // Which thread owns the loop before its first runOnce(): the one that makes it, or one that is started
+  // later. A loop for another thread opens all its own descriptors at once; a loop for this thread opens the
+  // timerfd with its first timer.
   enum class For { thisThread, anotherThread };
   static constexpr int kDescriptors = 3;
 
-  // Null when the system is out of descriptors or memory.
+  // Returns null if the system is out of descriptors or memory.
   static std::shared_ptr<EventLoop> make(For whom);
   ~EventLoop();
   EventLoop(const EventLoop&) = delete;
   EventLoop& operator=(const EventLoop&) = delete;
 
-  // Waits for one source and handles it: 1 when one was handled, 0 when the time passed or a signal came,
-  // negative errno. Ready descriptors take turns. A timer that is due comes after the descriptors that are
-  // ready at the same moment, and before their next turn. `timeOut` in microseconds; UINT64_MAX: none.
+  // Waits for one source and handles it. Returns 1 if one was handled, 0 if the time passed or a signal
+  // arrived, else a negative errno. Ready descriptors take turns. A timer that is due runs after the
+  // descriptors that are ready at the same moment, and before their next turn. `timeOut` is in microseconds;
+  // UINT64_MAX: none.
   int runOnce(std::uint64_t timeOut) noexcept;
 
-  // Any thread. May throw std::bad_alloc; a task that throws it is given up, with a line in the log.
+  // Any thread. May throw std::bad_alloc; a task that throws it is abandoned and logged.
   void post(std::function<void()> task);
   // Makes a waiting runOnce() return. Any thread, async-signal-safe.
   void wake() noexcept;
-  // Whether this is the loop's thread: before the first runOnce(), see For.
+  // Whether this is the loop's thread; before the first runOnce(), see For.
   bool onLoopThread() const noexcept;
 
   // Loop thread only.
   std::unique_ptr<DescriptorSource> addDescriptor(int fd, Interest interest,
                                                   RunLoop::DescriptorHandler handler);
 
-  // A timer that may be made, armed and destroyed on any thread. `failed` runs on the loop's thread when it
-  // could not be armed there. Null when it could not be made at once.
+  // A timer that any thread may make, arm and destroy. `failed` runs on the loop's thread if it could not be
+  // armed there. Returns null if it could not be made.
   std::unique_ptr<LoopSource> addTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
                                        std::chrono::nanoseconds leeway, std::function<void()> handler,
                                        std::function<void()> failed);
 
-  // Runs the task once, later. A task that cannot be put off runs at once: too early is better than never.
-  // Any thread.
+  // Runs the task once, later. If no timer can be made, it runs at once: too early is better than never. Any
+  // thread.
   void postAfter(std::chrono::nanoseconds delay, std::function<void()> task);
 
  private:

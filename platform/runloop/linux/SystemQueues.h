@@ -12,10 +12,10 @@
 
 namespace brenvik {
 
-// The run loop of the thread that makes it, on epoll(7).
+// The run loop of the thread that makes it, built on epoll(7).
 class SystemRunLoop final : public RunLoop {
  public:
-  // Null when the system is out of descriptors or memory.
+  // Returns null if the system is out of descriptors or memory.
   static std::unique_ptr<SystemRunLoop> make();
 
   RunResult run(std::chrono::duration<double> timeOut, ReturnAfterSource returnAfterSource) override;
@@ -34,12 +34,13 @@ class SystemRunLoop final : public RunLoop {
 };
 
 // Queues on threads of their own, and the main queue on the main run loop. A process-exit source is a pidfd
-// (pidfd_open(2)) watched by the main run loop: the global queue's thread starts when there is something to
-// tell. A queue may go kReservedDescriptors beyond the process's soft limit (RLIMIT_NOFILE), where the hard
-// one lets it: clients who use up everything else do not keep the process's own work from starting.
+// (pidfd_open(2)) that the main run loop watches; the global queue's thread starts only when a process has
+// exited. If the hard limit allows it, a queue may use kReservedDescriptors beyond the process's soft limit
+// (RLIMIT_NOFILE), so that clients who use up all other descriptors cannot keep the process's own work from
+// starting.
 class SystemQueues final : public WorkQueues {
  public:
-  // What a process should leave between its soft limit and the hard one.
+  // The descriptors that a process should leave between its soft limit and the hard one.
   static constexpr unsigned kReservedDescriptors = 36;
 
   // The run loop must outlive this object.
@@ -57,7 +58,7 @@ class SystemQueues final : public WorkQueues {
   class Maker;
   const std::shared_ptr<EventLoop> mainLoop_;
   const std::unique_ptr<WorkQueue> main_;
-  const std::shared_ptr<Maker> maker_;  // an exit that is told late finds it, or finds it gone
+  const std::shared_ptr<Maker> maker_;  // late exit handlers hold it weakly
 };
 
 }  // namespace brenvik

@@ -11,7 +11,7 @@
 
 namespace brenvik {
 
-// What a TimerHeap orders. Times are nanoseconds of whatever clock the owner uses.
+// The base class of the items in a TimerHeap. Times are nanoseconds of the owner's clock.
 struct TimerHeapItem {
   std::uint64_t next = 0;    // due from here on
   std::uint64_t leeway = 0;  // may be late by this much
@@ -25,17 +25,17 @@ struct TimerHeapItem {
   std::size_t place_ = kNowhere;
 };
 
-// Timers by the latest time at which each must fire; equal ones in the order in which they were added. The
-// earliest of those times is when to wake up, and a timer that may fire by then need not wake anybody later.
-// An item is in one heap at most. One thread only.
+// Orders timers by the latest time at which each must fire; equal ones in the order in which they were added.
+// The loop wakes at the earliest of those times and also fires the timers that are due by then. An item is in
+// at most one heap. One thread only.
 template <typename Item>
 class TimerHeap {
  public:
   bool isEmpty() const noexcept { return heap_.empty(); }
   std::size_t size() const noexcept { return heap_.size(); }
-  // The one that must fire first. Not of an empty heap.
+  // The timer that must fire first. Precondition: the heap is not empty.
   const std::shared_ptr<Item>& first() const noexcept { return heap_.front(); }
-  // When that is; UINT64_MAX when there is none.
+  // The latest time at which that timer must fire; UINT64_MAX if there is none.
   std::uint64_t wakeUp() const noexcept {
     return heap_.empty() ? std::numeric_limits<std::uint64_t>::max() : base(0).latest_;
   }
@@ -48,7 +48,7 @@ class TimerHeap {
     settle(heap_.size() - 1);
   }
 
-  // Takes an item out; nothing happens when it is not in.
+  // Removes an item; does nothing if it is not in the heap.
   void remove(Item& item) noexcept {
     const std::size_t at = static_cast<TimerHeapItem&>(item).place_;
     if (at == TimerHeapItem::kNowhere) return;
@@ -62,7 +62,7 @@ class TimerHeap {
     if (at < heap_.size()) settle(at);
   }
 
-  // Changes the time of an item that is in the heap. It comes after those of the same time.
+  // Changes the time of an item in the heap. It is ordered after items with the same time.
   void move(Item& item, std::uint64_t next) noexcept {
     item.next = next;
     static_cast<TimerHeapItem&>(item).order_ = ++lastOrder_;

@@ -14,18 +14,18 @@
 
 namespace brenvik {
 
-// The unit of the system's service manager that a control group is: the last component of its path, when
-// nothing but slices of that manager stand above it. Empty for every other group, those below user.slice or
-// below another unit included: whoever such a group was handed to names its children.
+// Returns the unit of the system's service manager that a control group belongs to: the last component of its
+// path, if only slices of that manager are above it. Empty for every other group, including those below
+// user.slice or another unit, because their owners choose the names.
 std::string_view unitOfCgroup(std::string_view path) noexcept;
 
-// The same of the process's path in the unified hierarchy ("0::" line) of /proc/PID/cgroup (cgroups(7)), or,
-// where there is no such line, in the hierarchy named systemd.
+// The same for the text of /proc/PID/cgroup (cgroups(7)): uses the path in the unified hierarchy ("0::" line)
+// or, without such a line, in the hierarchy named systemd.
 std::string_view unitOfCgroups(std::string_view text) noexcept;
 
-// One process, held by its folder in /proc: a process that takes over the id later is another folder, so what
-// is read here is never mixed up. Every question may find that the process is gone. One thread at a time;
-// nothing throws but std::bad_alloc.
+// One process, held by its open folder in /proc. A process that gets the same id later has another folder, so
+// the two are never mixed up. Any call may find that the process has exited. One thread at a time; throws
+// only std::bad_alloc.
 class CallerProcess {
  public:
   struct FileIdentity {
@@ -34,18 +34,19 @@ class CallerProcess {
     bool operator==(const FileIdentity&) const = default;
   };
 
-  // Nothing when there is no such process, or it started at another time. `proc` is "/proc".
+  // Returns nothing if there is no such process, or it started at another time. `proc` is "/proc" (except in
+  // tests).
   static std::optional<CallerProcess> pin(const std::string& proc, pid_t pid, std::uint32_t startTime);
 
-  // The file that the process executes now; nothing when it has exited, whether its parent knows or not.
+  // The file that the process executes now; nothing if it has exited, even if it is still a zombie.
   std::optional<FileIdentity> executable() const noexcept;
-  // The same, open for reading; not valid when it cannot be opened.
+  // The same, open for reading; invalid if it cannot be opened.
   UniqueFd openExecutable() const noexcept;
-  // The path of that file as the kernel tells it; empty when unknown.
+  // The path of that file according to the kernel; empty if unknown.
   std::string executablePath() const;
-  // The unit of the service manager it runs in; empty when in none or unknown.
+  // The unit of the service manager that it runs in; empty if none or unknown.
   std::string unit() const;
-  // Its user namespace; nothing when it is gone or may not be looked at.
+  // Its user namespace; nothing if it has exited or may not be inspected.
   std::optional<FileIdentity> userNamespace() const noexcept;
   static std::optional<FileIdentity> namespaceOfThisProcess(const std::string& proc);
 

@@ -12,12 +12,12 @@
 
 namespace brenvik {
 
-// Entitlements from property-list files that the administrator keeps, see EntitlementSearch.h. A caller that
-// has ended, or is in another user namespace than this process, is no task. Any thread.
+// Entitlements from the administrator's property-list files, see EntitlementSearch.h. A caller that has
+// exited, or is in another user namespace than this process, has no task. Any thread.
 class EntitlementFiles final : public TaskSecurity {
  public:
-  // The directories named at build time (BRENVIK_ENTITLEMENT_DIRECTORIES). `accounts` must outlive this
-  // object; this object outlives its tasks.
+  // Uses the directories named at build time (BRENVIK_ENTITLEMENT_DIRECTORIES). `accounts` must outlive this
+  // object, which must outlive its tasks.
   explicit EntitlementFiles(AccountDirectory& accounts);
   // Earlier directories first. `proc` is where proc(5) is mounted.
   EntitlementFiles(AccountDirectory& accounts, std::vector<std::string> directories,

@@ -20,51 +20,50 @@
 
 namespace brenvik {
 
-// Whom the files are asked about: a process that sent a message, or one that somebody wonders about.
+// The subject of a search: a process that sent a message, or one that somebody asks about.
 class EntitlementCandidate {
  public:
   virtual ~EntitlementCandidate() = default;
   virtual uid_t uid() const noexcept = 0;
-  // The file it executes, the same for the life of this object; nothing when there is none or it is not
-  // known.
+  // The file that it executes, the same for the life of this object; nothing if there is none or it is
+  // unknown.
   virtual const std::optional<CallerProcess::FileIdentity>& executable() noexcept = 0;
-  // The file it executes now, open for reading; not valid when it cannot be opened, errno says why.
+  // The file that it executes now, open for reading. Returns an invalid descriptor and sets errno on failure.
   virtual UniqueFd openExecutable() noexcept = 0;
-  // Its unit of the system's service manager; empty when in none.
+  // Its unit of the system's service manager; empty: none.
   virtual const std::string& unit() = 0;
 };
 
 // One step of a search, for people.
 struct EntitlementFinding {
   enum class Kind : std::uint8_t {
-    holds,    // it is so of the candidate
-    differs,  // it is not so: the file does not match
-    wrong,    // it makes the file or directory passed over, whoever asks
-    unknown,  // it cannot be found out now: the search ends without an answer
+    holds,    // the condition is true of the candidate
+    differs,  // the condition is false, so the file does not match
+    wrong,    // the file or directory is skipped for every candidate
+    unknown,  // it cannot be found out now; the search ends without an answer
     note,     // worth knowing; decides nothing
   };
   std::string path;  // the directory or file
   std::string key;   // the key of the file; empty for the file or directory as a whole
   Kind kind;
-  std::string text;  // "is root", "does not exist": to stand behind the key or the path
+  std::string text;  // follows the key or the path: "is root", "does not exist"
 };
 
-// The property-list files in which the administrator says who holds which entitlement (this folder's
-// neighbour README.md says what stands in them). They are read afresh for each search, in order, until one
-// answers. What is wrong with a file or directory is logged once for each state of it. Any thread; throws
-// nothing but std::bad_alloc.
+// Searches the property-list files in which the administrator says who holds which entitlement (../README.md
+// describes them). It reads them again for each search, in order, until one answers. It logs each fault of a
+// file or directory once for each state of that file. Any thread; throws only std::bad_alloc.
 class EntitlementSearch {
  public:
   // Earlier directories first. `accounts` must outlive this object.
   EntitlementSearch(AccountDirectory& accounts, std::vector<std::string> directories);
 
   struct Result {
-    PropertyList value;  // none when no file gives one
+    PropertyList value;  // none if no file gives one
     bool error = false;  // a file that might matter could not be examined
-    std::string file;    // the one that gave the value
+    std::string file;    // the file that gave the value
   };
-  // With `findings` each step is told there and nothing is logged; files that do not match are then compared
-  // in every key. The result is the same.
+  // With `findings`, it records each step there and logs nothing, and compares every key even of files that
+  // do not match. The result is the same.
   Result find(std::string_view name, EntitlementCandidate& candidate,
               std::vector<EntitlementFinding>* findings = nullptr);
 
@@ -80,7 +79,7 @@ class EntitlementSearch {
     timespec changed{};
     std::string reason;
   };
-  // Whether this was not logged yet.
+  // True if this was not logged yet.
   bool isNews(const std::string& path, FileState state);
   void forget(const std::string& path) noexcept;
 
@@ -93,8 +92,8 @@ class EntitlementSearch {
 // The directories named at build time (BRENVIK_ENTITLEMENT_DIRECTORIES).
 std::vector<std::string> entitlementDirectories();
 
-// Why a search gave no value true, in half a sentence: which file came nearest, and which of its keys is to
-// blame.
+// Explains in half a sentence why a search gave no value true: the file that came nearest, and the key that
+// did not match.
 std::string whyNotEntitled(const EntitlementSearch::Result& result,
                            const std::vector<EntitlementFinding>& findings);
 

@@ -11,8 +11,8 @@ namespace brenvik {
 
 using Sha256Digest = std::array<std::uint8_t, 32>;
 
-// The digest of a file's bytes, from the descriptor's position to the end. Nothing when it cannot be read, or
-// there is no libcrypto: that library is loaded by the first call, not before. Any thread; reads to the end.
+// Returns the digest of a file's bytes, from the descriptor's position to the end. Returns nothing if the
+// file cannot be read, or there is no libcrypto, which the first call loads. Any thread.
 std::optional<Sha256Digest> sha256OfFile(int fd) noexcept;
 
 // 64 hexadecimal digits, either case; nothing for any other text.

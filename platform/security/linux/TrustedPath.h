@@ -8,26 +8,26 @@
 
 namespace brenvik {
 
-// Where a path leads, and whether only root can change that: every folder on the way and every link that is
-// followed belongs to root, and no such folder may be written by group or others. A folder with the sticky
-// bit may, because nobody can rename root's entries there.
+// The target of a path, and whether only root can change it. That is so if root owns every folder on the path
+// and every link that is followed, and neither group nor others may write to such a folder, unless it has the
+// sticky bit, because then nobody can rename root's entries there.
 struct TrustedPath {
   enum class Outcome {
-    trusted,    // `facts` are of what stands at `place`; its own owner and mode are for the caller to judge
-    untrusted,  // somebody else than root can change what stands at `place`
-    missing,    // nothing can be reached there: `error` says why
-    unknown,    // it cannot be found out now: `error` says why
+    trusted,    // `facts` describe the item at `place`; the caller must check its own owner and mode
+    untrusted,  // another account than root can change the item at `place`
+    missing,    // there is no item that can be reached; `error` says why
+    unknown,    // it cannot be found out now; `error` says why
   };
   Outcome outcome = Outcome::unknown;
   struct stat facts = {};
-  std::string place;  // without links; of what is untrusted: the folder or link at fault
+  std::string place;  // without links; if untrusted, the folder or link at fault
   int error = 0;
 };
 
-// `path` is absolute. Nothing but std::bad_alloc is thrown.
+// `path` must be absolute. Throws only std::bad_alloc.
 TrustedPath walkTrustedPath(const std::string& path);
 
-// Whether only root can have made it and can change it.
+// Whether only root can have made the item and can change it.
 bool isRootsAlone(const struct stat& facts) noexcept;
 
 }  // namespace brenvik

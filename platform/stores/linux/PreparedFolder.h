@@ -12,8 +12,8 @@
 
 namespace brenvik {
 
-// <home>/Library/<name>. No link below the home is followed; those on the way to it only when nobody but root
-// can have placed them.
+// The folder <home>/Library/<name>. No link below the home is followed; links on the path to the home are
+// followed only if nobody but root can have put them there.
 class PreparedFolder final : public StoreFolder {
  public:
   struct Account {
@@ -22,13 +22,13 @@ class PreparedFolder final : public StoreFolder {
     gid_t gid;
   };
 
-  // `account` is asked each time, so that nothing is looked up before the first; it may throw std::bad_alloc.
-  // `file` is the database's name in the folder.
+  // `account` is called for each operation, so nothing is looked up before the first; it may throw
+  // std::bad_alloc. `file` is the database's name in the folder.
   PreparedFolder(std::function<Account()> account, std::string name, std::string file)
       : account_(std::move(account)), name_(std::move(name)), file_(std::move(file)) {}
 
-  // Folders that are missing are made for the account, "Library" with mode 0755 and the store's with 0700;
-  // they show whole or not at all, and are on the disk when they were made.
+  // Makes missing folders for the account, "Library" with mode 0755 and the store's with 0700. They appear
+  // complete or not at all, and are on the disk when this returns.
   State open(IfMissing ifMissing, Opened* folder) noexcept override;
   bool prepare(const Opened& folder) noexcept override;
 

@@ -11,7 +11,8 @@
 
 namespace brenvik {
 
-// From a connection's making to its last answer. A telephony daemon that needs longer is taken for hanging.
+// The time limit from a connection's construction to its last answer. A telephony daemon that needs longer
+// counts as hung.
 inline constexpr std::chrono::milliseconds kTelephonyPatience{1000};
 
 // The telephony daemon behind its named service, a unix(7) SOCK_SEQPACKET socket in the bootstrap directory.

@@ -16,21 +16,20 @@ namespace brenvik {
 
 class SqliteTimeLimit;
 
-// The tokens in an SQLite database, voicemail.db, which the first change makes. It is opened for each
-// operation, so that an idle process keeps neither it nor its lock. A database that is damaged is moved
-// aside, to voicemail.db.damaged or, where there is one already, to voicemail.db.damaged.1 and so on, and a
-// new one made. Without any right but the account's own: what it may not use is a store that cannot be
-// opened.
+// The tokens in an SQLite database, voicemail.db, which the first change makes. It uses only its own
+// account's rights: a database that the account may not use is a store that cannot be opened. A damaged
+// database is renamed to voicemail.db.damaged or, if that exists, to voicemail.db.damaged.1 and so on, and a
+// new one is made.
 class SqliteVoicemailStore final : public VoicemailStore {
  public:
   enum class Purpose { reading, writing };
 
-  // How long one operation may wait for other processes and run statements. A request has two at most, and
-  // three seconds with what the disk takes.
+  // How long one operation may wait for other processes and run statements. A request has at most two
+  // operations, and three seconds including the disk.
   static constexpr std::chrono::milliseconds kPatience{1000};
 
-  // `folder` gives the descriptor of its folder for each operation, which it keeps open; -1 with ENOENT:
-  // there is none yet, and the store is empty. It may throw std::bad_alloc.
+  // Returns the descriptor of the store's folder for each operation, and keeps it open. -1 with errno ENOENT
+  // means that there is no folder yet and the store is empty. May throw std::bad_alloc.
   using Folder = std::function<int(Purpose)>;
   explicit SqliteVoicemailStore(Folder folder, SqliteTime time = SqliteTime::ofTheSystem());
   ~SqliteVoicemailStore() override;

@@ -55,14 +55,14 @@ class ThreadedWorker final : public Worker {
     ++givenUp_;
   }
 
-  // All channels hang up; the next one is of a new worker.
+  // All channels hang up; the next one belongs to a new worker.
   void die() noexcept {
     const std::lock_guard lock(mutex_);
     ++generation_;
     for (const UniqueFd& socket : sockets_) (void)::shutdown(socket.get(), SHUT_RDWR);
   }
 
-  // What open() says from now on, and nothing is opened unless it is `done`.
+  // Sets the result of later open() calls; unless it is `done`, they open nothing.
   void answerWith(WorkerResult answer) noexcept {
     const std::lock_guard lock(mutex_);
     answer_ = answer;

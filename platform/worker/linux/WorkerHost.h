@@ -18,18 +18,18 @@ class WorkerHost {
     WorkerRights rights;
   };
 
-  // Gets a channel that the helper has opened, and the sort of work that it is for. On the main thread, which
-  // goes on with the next one when it returns: the work itself belongs elsewhere. May throw std::bad_alloc,
-  // which closes the channel.
+  // Gets a channel that the helper has opened, and the kind of its work. Runs on the main thread, which waits
+  // for it before it takes the next channel, so the work itself must be done on another thread. May throw
+  // std::bad_alloc, which closes the channel.
   using Serve = std::function<void(std::uint32_t work, WorkerChannel channel)>;
 
   // Clears the environment, takes the connection of the helper that started this program (as standard input)
-  // or the listening socket of the service manager, gives up the rights, and only then reads what the helper
-  // sends. Talks to root's processes only. Returns when the last of them has hung up, with the status to
-  // leave with: by _exit(2), as work may still be under way on other threads.
+  // or the listening socket of the service manager, gives up the rights, and only then reads from the helper.
+  // Serves only root's processes. Returns the exit status when the last of them has hung up. Exit with
+  // _exit(2), because work may still be under way on other threads.
   static int run(const Description& description, const Serve& serve) noexcept;
 
-  // The part after that, for tests: serves one connection until it hangs up.
+  // For tests, the part after giving up the rights: serves one connection until it hangs up.
   static void serveConnection(WorkerChannel connection, const Serve& serve) noexcept;
 };
 

@@ -16,40 +16,41 @@
 
 namespace brenvik {
 
-// One worker, behind the socket of its named service. Where nobody listens there, it is this process's child:
-// the program beside this one, or where it is installed. Both come with the first open(), and again after the
-// worker's death. What goes wrong is logged, a few lines in a row at most. Any thread.
+// One worker, behind the socket of its named service. If nobody listens there, the worker is a child of this
+// process: the program beside this one, or the installed one. The first open() connects or starts it, and so
+// does the first open() after the worker's death. Failures are logged, with a limit on lines in a row. Any
+// thread.
 class WorkerProgram final : public Worker {
  public:
   struct Description {
     std::string service;    // name of the service
     std::string program;    // name of the program
     std::string bootstrap;  // folder of the services' sockets
-    // Folders where the program may lie, best first; without any, those of workerProgramFolders().
+    // Folders that may hold the program, best first; if empty, those of workerProgramFolders().
     std::vector<std::string> folders;
   };
   using Clock = std::chrono::steady_clock;
 
-  // Lines that may come in a row, and how long it takes until one more may.
+  // The most lines in a row, and the time after which one more is allowed.
   static constexpr int kLinesInARow = 5;
   static constexpr std::chrono::seconds kOneMoreLineEvery{10};
 
   explicit WorkerProgram(Description description, std::function<Clock::time_point()> now = &Clock::now);
   WorkerProgram(const WorkerProgram&) = delete;
   WorkerProgram& operator=(const WorkerProgram&) = delete;
-  // Hangs up, and ends a child that does not leave.
+  // Hangs up, and kills a child that does not exit.
   ~WorkerProgram() override;
 
   WorkerResult open(std::uint32_t work, WorkerChannel* channel) noexcept override;
   void giveUp(WorkerChannel* channel) noexcept override;
 
-  // Whether a worker is connected, or being reached at this moment. Starts none, and does not wait.
+  // Whether a worker is connected or being connected. Starts none, and does not wait.
   bool isRunning() const noexcept;
 
  private:
   struct Child {
     pid_t pid = -1;
-    UniqueFd process;  // pidfd_open(2); invalid when there was no descriptor for it
+    UniqueFd process;  // pidfd_open(2); invalid if there was no descriptor for it
   };
 
   WorkerResult reach();
@@ -66,7 +67,7 @@ class WorkerProgram final : public Worker {
   WorkerChannel connection_;
   std::uint64_t generation_ = 0;
   Child child_;
-  std::vector<Child> dying_;  // killed, and not gone yet
+  std::vector<Child> dying_;  // killed, but not yet dead
   Clock::time_point linesPaidUntil_{};
 };
 

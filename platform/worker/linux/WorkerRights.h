@@ -11,27 +11,27 @@
 
 namespace brenvik {
 
-// What a worker keeps of the power that it is started with.
+// The rights that a worker keeps of those that it was started with.
 struct WorkerRights {
-  // The account that it becomes when root started it: the first of these that exists.
+  // If root started it, it changes to the first of these accounts that exists.
   std::vector<std::string> accounts;
-  // Where none of them exists: this number, as user and as group. -1: then the worker does not run.
+  // If none of them exists: this number, as user and as group. -1: the worker then does not run.
   uid_t otherwise = static_cast<uid_t>(-1);
-  // Capabilities (capabilities(7)) that it keeps when root started it and its group is this one. None: no
-  // capability.
+  // Returns the capabilities (capabilities(7)) that it keeps if root started it and this is its group. Empty:
+  // it keeps none.
   std::function<std::vector<int>(gid_t)> keptCapabilities;
-  // It opens no socket but local ones, starts no program and looks into no other process: a filter of system
-  // calls (seccomp(2)) refuses that. On machines that the filter does not know it is left out.
+  // A system call filter (seccomp(2)) lets it open only local sockets, and forbids it to start programs and
+  // to inspect other processes. There is no filter on architectures that it does not support.
   bool isLocalOnly = false;
   rlim_t descriptors = 256;
-  // Bytes of address space; 0: no limit. Not with sanitizers, whose shadow memory is larger than any limit.
+  // Bytes of address space; 0: no limit. Ignored with sanitizers, whose shadow memory exceeds any limit.
   rlim_t addressSpace = 0;
 };
 
-// Gives up everything else for good: root's account and groups, capabilities, new privileges through exec(2),
-// core dumps, and being looked at by other processes of the account. Then checks that there is no way back.
-// In a user namespace that has one account only, that account stays, whatever it is called. Null, or in words
-// what went wrong: then the process must not go on. Before other threads start.
+// Irrevocably gives up everything else: root's account and groups, capabilities, new privileges through
+// exec(2), core dumps, and inspection by other processes of the account. Then checks that it cannot get them
+// back. In a user namespace with a single account it keeps that account. Returns null, or a description of
+// the failure, after which the process must not continue. Call it before other threads start.
 const char* giveUpRights(const WorkerRights& rights) noexcept;
 
 }  // namespace brenvik

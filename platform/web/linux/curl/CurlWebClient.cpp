@@ -284,7 +284,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
       abandonAll(WebErrorKind::cancelled);
       return;
     }
-    // Whoever waits for a transfer waits until this is done, so it is, however long memory is short.
+    // Callers wait until this has run, so it must run even if memory is short for a while.
     runAndWait(*queue, [this] { abandonAll(WebErrorKind::cancelled); });
   }
 

@@ -17,19 +17,20 @@ struct CurlSettings {
   std::string certificateAuthorities;  // a file of trusted certificates; empty: the system's
   std::chrono::milliseconds connectLimit = std::chrono::seconds(30);  // name, connection and TLS together
   std::chrono::seconds stallLimit = std::chrono::seconds(30);  // two at least: rates are taken over a second
-  // A request as a whole: so long, and what its largest body takes at the slowest rate. A real body is far
-  // smaller than the largest, so a slow link has time enough; a server that trickles has not.
+  // The limit of a whole request: this long, plus the time that its largest body takes at the slowest rate. A
+  // real body is far smaller than the largest, so a slow link has enough time, but a server that trickles has
+  // not.
   std::chrono::milliseconds wholeLimit = std::chrono::minutes(1);
   std::uint64_t slowestBytesPerSecond = std::uint64_t{64} << 10;
   CellularRuleFiles cellularFiles;
   bool bodiesForAnotherProcess = false;  // see WebBody
 };
 
-// The HTTP client on libcurl's multi interface, driven by a queue of its own. What is under way when it is
-// destroyed completes as cancelled. Not to be destroyed on a queue it made or calls back on.
+// The HTTP client on libcurl's multi interface, driven by its own queue. Requests under way when it is
+// destroyed complete as cancelled. Do not destroy it on a queue that it made or calls back on.
 class CurlWebClient final : public WebClient {
  public:
-  // Null when libcurl does not start.
+  // Returns null if libcurl does not start.
   static std::unique_ptr<CurlWebClient> make(WorkQueues& queues, CurlSettings settings = {});
   ~CurlWebClient() override;
 

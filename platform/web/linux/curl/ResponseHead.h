@@ -9,19 +9,19 @@
 
 #include "platform/web/WebTypes.h"
 
-// What a server's words come to before libcurl or anybody else acts on them.
+// Checks a server's header and URLs before libcurl or other code acts on them.
 namespace brenvik {
 
-// The header fields of a response, taken line by line as libcurl hands them over. Throws std::bad_alloc.
+// The header fields of a response, line by line as libcurl delivers them. Throws std::bad_alloc.
 class ResponseHead {
  public:
-  // Of all lines of one attempt together; a sane server stays far below.
+  // The most bytes in all lines of one attempt; a sane server sends far fewer.
   static constexpr std::size_t kMaxSize = std::size_t{256} * 1024;
 
-  // False when that is too much. A line that starts a response, after an interim one, starts anew. A line
-  // that begins with a blank goes on with the field before it (RFC 9112, 5.2).
+  // Takes a line; returns false if there are too many bytes. A status line after an interim response starts
+  // again. A line that begins with a blank continues the previous field (RFC 9112, 5.2).
   bool takeLine(std::string_view line);
-  // From here on lines are trailers, which are not taken.
+  // Later lines are trailers, which are ignored.
   void bodyBegins() noexcept { bodyHasBegun_ = true; }
   bool bodyHasBegun() const noexcept { return bodyHasBegun_; }
 
@@ -38,10 +38,10 @@ struct ParsedUrl {
   std::string host;    // without the brackets of an IPv6 address; never empty
 };
 
-// Nothing when the text is no URL: blanks and control characters in it included.
+// Returns nothing if the text is not a URL, for example if it has blanks or control characters.
 std::optional<ParsedUrl> parseUrl(const std::string& text);
 
-// Addresses are not looked up, nor is this machine's own name, which libcurl knows by itself.
+// False for addresses, and for this machine's own name, which libcurl resolves by itself.
 bool needsLookUp(const std::string& host);
 
 }  // namespace brenvik
