@@ -53,8 +53,10 @@ Result guarded(Result onExhaustion, const Work& work) noexcept {
 bool settle(bvmh_value* handle) noexcept {
   if (!handle->isChanged) return true;
   return guarded(false, [handle] {
-    handle->value = handle->value.is(Type::array) ? PropertyList::array(handle->elements)
-                                                  : PropertyList::dictionary(handle->entries);
+    PropertyList made = handle->value.is(Type::array) ? PropertyList::array(handle->elements)
+                                                      : PropertyList::dictionary(handle->entries);
+    if (!made) return false;  // more elements than a property list can have: the handle keeps them
+    handle->value = std::move(made);
     handle->isChanged = false;
     handle->elements.clear();
     handle->entries.clear();
