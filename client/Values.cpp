@@ -274,6 +274,8 @@ int32_t bvmh_value_write(const bvmh_value* value, bvmh_region* bytes) {
     if (!made) return BVMH_ERROR_NOT_A_VALUE;
     void* copy = std::malloc(made->size());
     if (copy == nullptr) return BVMH_ERROR_NO_MEMORY;
+    // Bytes, not a text.
+    // NOLINTNEXTLINE(bugprone-not-null-terminated-result)
     std::memcpy(copy, made->data(), made->size());
     *bytes = {copy, made->size(), copy, nullptr};
     return BVMH_OK;
