@@ -1,0 +1,15 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <cstdint>
+
+#include "platform/worker/WorkerChannel.h"
+
+namespace brenvik {
+
+// Answers the helper's questions on one channel, one after the other. Returns when the helper hangs up or
+// sends a malformed question; then this end hangs up.
+void serveCallers(std::uint32_t work, WorkerChannel channel);
+
+}  // namespace brenvik
