@@ -2,8 +2,12 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "workers/callers/CallerService.h"
 
+#include <linux/capability.h>
 #include <linux/magic.h>
+#include <sys/syscall.h>
 #include <sys/vfs.h>
+
+#include <vector>
 
 #include "platform/security/linux/CallerFacts.h"
 
@@ -17,6 +21,25 @@ bool isOfProc(int folder) noexcept {
 }
 
 }  // namespace
+
+WorkerRights callerRights() {
+  WorkerRights rights;
+  rights.otherwise = 65534;
+  rights.keptCapabilities = [](gid_t) { return std::vector<int>{CAP_SYS_PTRACE}; };
+  rights.isLocalOnly = true;
+  // To take connections, questions and answers; to look at folders of /proc; memory; the end.
+  rights.onlyCalls = {SYS_recvmsg,        SYS_sendmsg, SYS_accept4,      SYS_getsockopt, SYS_shutdown,
+                      SYS_ppoll,          SYS_close,   SYS_statx,        SYS_readlinkat, SYS_fstatfs,
+                      SYS_clock_gettime,  SYS_brk,     SYS_mmap,         SYS_munmap,     SYS_mremap,
+                      SYS_madvise,        SYS_futex,   SYS_rt_sigreturn, SYS_exit,       SYS_exit_group,
+                      SYS_restart_syscall};
+#ifdef SYS_poll  // newer architectures have ppoll alone
+  rights.onlyCalls.push_back(SYS_poll);
+#endif
+  rights.descriptors = 32;
+  rights.addressSpace = rlim_t{64} << 20;
+  return rights;
+}
 
 void serveCallers(std::uint32_t work, WorkerChannel channel) {
   if (work != callers::kFacts) return;

@@ -4,8 +4,11 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdlib>
 #include <filesystem>
 #include <thread>
@@ -118,6 +121,88 @@ TEST_F(CallerServiceTest, HangsUpOnAnotherWork) {
   EXPECT_EQ(channel.receive(&answer, std::chrono::steady_clock::now() + std::chrono::seconds(20)),
             WorkerResult::closed);
 }
+
+#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
+// With the rights of the program: 0, or the number of what it can do and should not.
+int triesEverything(WorkerChannel theirs) {
+  if (giveUpRights(callerRights()) != nullptr) return 1;
+  int at = 10;
+  const std::string mother = "/proc/" + std::to_string(::getppid());
+  for (const std::string& path :
+       std::vector<std::string>{"/proc/1/root", "/proc/1/root/etc", mother + "/mem", mother + "/environ",
+                                "/proc/self/status", "/etc/hostname", "/dev/null"}) {
+    if (::open(path.c_str(), O_RDONLY | O_CLOEXEC) != -1 || errno != EPERM) return at;
+    if (::open(path.c_str(), O_PATH | O_CLOEXEC) != -1 || errno != EPERM) return at + 1;
+    at += 2;
+  }
+  for (const long call : {SYS_read,
+                          SYS_write,
+                          SYS_pread64,
+                          SYS_pwrite64,
+                          SYS_openat2,
+                          SYS_process_vm_readv,
+                          SYS_process_vm_writev,
+                          SYS_ptrace,
+                          SYS_pidfd_open,
+                          SYS_pidfd_getfd,
+                          SYS_execve,
+                          SYS_clone,
+                          SYS_kill,
+                          SYS_tgkill,
+                          SYS_socket,
+                          SYS_connect,
+                          SYS_unlinkat,
+                          SYS_linkat,
+                          SYS_symlinkat,
+                          SYS_renameat2,
+                          SYS_mkdirat,
+                          SYS_fchownat,
+                          SYS_fchmodat,
+                          SYS_ftruncate,
+                          SYS_chdir,
+                          SYS_getdents64,
+                          SYS_memfd_create,
+                          SYS_io_uring_setup,
+                          SYS_capset}) {
+    if (::syscall(call, -1, 0, 0, 0, 0, 0) != -1 || errno != EPERM) return at;
+    ++at;
+  }
+  serveCallers(callers::kFacts, std::move(theirs));
+  return 0;
+}
+
+TEST(CallerRightsTest, ItAnswersAndIsAbleToDoNothingElse) {
+  if (::geteuid() != 0) GTEST_SKIP() << "the program is root's to start";
+  WorkerChannel channel;
+  WorkerChannel theirs;
+  ASSERT_EQ(WorkerChannel::makePair(&channel, &theirs), WorkerResult::done);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    channel.close();
+    ::_exit(triesEverything(std::move(theirs)));
+  }
+  theirs.close();
+  WorkerMessage question;
+  question.kind = callers::kFacts;
+  question.descriptors.emplace_back(::open("/proc/self", O_PATH | O_CLOEXEC));
+  for (int i = 0; i < 2; ++i) {
+    WorkerMessage answer;
+    EXPECT_EQ(channel.send(question), WorkerResult::done);
+    EXPECT_EQ(channel.receive(&answer, std::chrono::steady_clock::now() + std::chrono::seconds(20)),
+              WorkerResult::done);
+    const auto facts = callers::decode(answer);
+    ASSERT_TRUE(facts);
+    EXPECT_EQ(facts->executable, identityAt(AT_FDCWD, "/proc/self/exe"));
+    EXPECT_EQ(facts->executablePath, fs::read_symlink("/proc/self/exe"));
+    EXPECT_EQ(facts->userNamespace, identityAt(AT_FDCWD, "/proc/self/ns/user"));
+  }
+  channel.close();
+  int status = -1;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+}
+#endif
 
 }  // namespace
 }  // namespace brenvik

@@ -429,7 +429,7 @@ class EntitlementSearch::Run {
     };
     // By its own path, which only root can lead elsewhere: through the caller's link in /proc the file would
     // come open with the rights of the caller's mounts.
-    const UniqueFd fd(::open(executable_.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    const UniqueFd fd(::openat(AT_FDCWD, executable_.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
     if (!fd.isValid() && errno == ENOENT) return hasChanged();
     struct stat facts {};
     if (::fstat(fd.get(), &facts) != 0) return cannotTell("cannot be compared: the file cannot be read");
