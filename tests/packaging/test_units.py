@@ -23,7 +23,7 @@ STORES = "brenvik-store-worker.service"
 CALLERS = "brenvik-caller-worker.service"
 RESTORE = "brenvik-mobile-helper-restore.service"
 # How exposed each may be, in tenths, and at how much its first comment puts it.
-MOST_EXPOSED = {SERVICE: 16, NETWORK: 16, STORES: 9, CALLERS: 12}
+MOST_EXPOSED = {SERVICE: 14, NETWORK: 16, STORES: 9, CALLERS: 12}
 SAID = {SERVICE: 1.3, NETWORK: 1.1, STORES: 0.4, CALLERS: 1.0}
 
 
@@ -69,7 +69,7 @@ class Units(unittest.TestCase):
         weaker = self.text.replace("ProtectSystem=strict", "ProtectSystem=no")
         (self.folder / "weaker.service").write_text(weaker)
         self.addCleanup((self.folder / "weaker.service").unlink)
-        done = self.analyze("security", "--offline=true", "--threshold=16", "--no-pager", name="weaker.service")
+        done = self.analyze("security", "--offline=true", f"--threshold={MOST_EXPOSED[SERVICE]}", "--no-pager", name="weaker.service")
         self.assertNotEqual(done.returncode, 0)
 
     def test_each_worker_listens_where_the_helper_looks_and_for_root_alone(self):
