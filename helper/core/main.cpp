@@ -44,6 +44,7 @@
 #include "platform/preferences/linux/FilePreferences.h"
 #include "platform/radio/linux/ModemManagerLogs.h"
 #include "platform/runloop/linux/SystemQueues.h"
+#include "platform/security/linux/CallerReader.h"
 #include "platform/security/linux/EntitlementFiles.h"
 #include "platform/servicemanager/linux/NotifySocket.h"
 #include "platform/stores/RemoteContacts.h"
@@ -238,7 +239,15 @@ int run() {
   }
   SystemQueues queues(*loop);
   PasswordDatabase accounts;
-  EntitlementFiles security(accounts);
+  // Asked only where this process lacks the capability that reads other accounts' executables, as under its
+  // unit; with root's rights of its own it reads them itself.
+  WorkerProgram callerWorker({.service = callers::kService,
+                              .program = callers::kProgram,
+                              .bootstrap = BRENVIK_BOOTSTRAP_DIRECTORY,
+                              .folders = {},
+                              .isOnlyService = true});
+  RemoteCallerReader callerReader(callerWorker);
+  EntitlementFiles security(accounts, &callerReader);
   EntitlementCheck entitlements(security, queues);
 
   SystemPortSpace ports;

@@ -131,10 +131,10 @@ class Logs:
 class Daemon:
     """The real daemon, standing alone or activated through a listening socket that the test holds."""
 
-    def __init__(self, activated=False, wait=True, arguments=(), environment=None, listening=None):
+    def __init__(self, activated=False, wait=True, arguments=(), environment=None, listening=None, prefix=()):
         environment = {**os.environ, **(environment or {})}
         self.listening = listening
-        command = [str(DAEMON), *arguments]
+        command = [*prefix, str(DAEMON), *arguments]
         if activated:
             if self.listening is None:
                 self.listening = listen()

@@ -30,7 +30,7 @@ import zlib
 SERVICE = "brenvik-mobile-helper.service"
 SOCKET = "brenvik-mobile-helper.socket"
 PATH = "/run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper"
-WORKERS = {"network": PATH + ".network", "store": PATH + ".stores"}
+WORKERS = {"caller": PATH + ".callers", "network": PATH + ".network", "store": PATH + ".stores"}
 HELPER = "/usr/libexec/brenvik/BrenvikMobileHelper"
 IDLE = 10.0
 CIVIC_PUSH, ADDRESS_PUSH = 'country "NO", city "Oslo"', 'address "203.0.113.9"'
@@ -599,7 +599,7 @@ def held_in_its_sandbox():
     main = int(property_of(SERVICE, "MainPID"))
     status = pathlib.Path(f"/proc/{main}/status").read_text()
     fields = dict(line.split(":\t") for line in status.splitlines() if ":\t" in line)
-    bits = {"CAP_CHOWN": 0, "CAP_DAC_OVERRIDE": 1, "CAP_FOWNER": 3, "CAP_SYS_PTRACE": 19}
+    bits = {"CAP_CHOWN": 0, "CAP_DAC_OVERRIDE": 1, "CAP_FOWNER": 3}
     expect_equal(int(fields["CapBnd"], 16), sum(1 << each for each in bits.values()), "bounding set")
     expect_equal((fields["NoNewPrivs"], fields["Seccomp"]), ("1", "2"), "no new privileges, a filter")
     # Privileges of the archive reader are looked at by its tests; here: it was started in the same sandbox.
@@ -661,9 +661,29 @@ def a_helper_that_was_taken_over_is_held():
     expect_equal([each for each in found["writable"] if not each.startswith("/dev/")],
                  ["/root/Library", PATH.rpartition("/")[0], "/tmp", "/var/lib/brenvik", "/var/mobile", "/var/tmp"],
                  "places where it could write a file")
-    # What is still open, as SECURITY.md says: reading which program a caller runs takes a capability that also lets it go
-    # through another process's root folder, to what is mounted there. Whoever closes that changes the page.
-    expect_equal((found["around"], found["memory_around"]), (["somebody"], "done"), "the way around through /proc/PID/root")
+    expect_equal((found["around"], found["memory_around"]), ("EACCES", "EACCES"), "the way around through /proc/PID/root")
+    # From the one that may look into processes it learns what they execute, and nothing else.
+    expect("/sleep" in found["told"], f"which program runs: {found['told']!r}")
+    expect_equal(found["told_of_a_link"], "", "where a link leads that it made itself")
+
+
+def a_caller_worker_that_was_taken_over_is_held():
+    """By its unit: no network, nothing to write, no account of anybody's. Its capability would lead it further, but by then
+    the program has a filter of its own, without a call that opens anything: its unit test tries them all."""
+    with a_home_with_a_secret():
+        found = probed("brenvik-caller-worker.service")
+    expect_refused(found, signal="EPERM", root_account="EPERM", **OF_OTHERS, **NO_NETWORK)
+    expect_equal(found["writable"], [], "places where it could write a file")
+    expect_equal((found["sees /home"], found["sees /root"], found["sees /tmp"]), ("EACCES", "EACCES", "EACCES"), "homes, packages")
+    bvhelperctl("ping")
+    process = property_of("brenvik-caller-worker.service", "MainPID")
+    fields = dict(line.split(":\t") for line in pathlib.Path(f"/proc/{process}/status").read_text().splitlines() if ":\t" in line)
+    expect_equal((int(fields["CapPrm"], 16), int(fields["CapEff"], 16), int(fields["CapBnd"], 16)), (1 << 19,) * 3, "CAP_SYS_PTRACE")
+    expect_equal((fields["NoNewPrivs"], fields["Seccomp"]), ("1", "2"), "no new privileges, filters")
+    helper = pathlib.Path(f"/proc/{property_of(SERVICE, 'MainPID')}/status").read_text()
+    of_units = int(dict(line.split(":\t") for line in helper.splitlines() if ":\t" in line)["Seccomp_filters"])
+    expect(int(fields["Seccomp_filters"]) >= of_units + 1, f"filters of its own: {fields['Seccomp_filters']}, {of_units} of a unit")
+    expect(0 not in map(int, fields["Uid"].split() + fields["Gid"].split()), "it is not root")
 
 
 def a_network_worker_that_was_taken_over_is_held():
@@ -712,7 +732,7 @@ def only_root_reaches_a_worker():
 
 
 def other_accounts_are_told_apart():
-    """Reading the executable of another account's process is what CAP_SYS_PTRACE is kept for."""
+    """Reading the executable of another account's process is what the caller worker is for."""
     run("useradd", "--system", "--no-create-home", "telephony")
     done = run("setpriv", "--reuid=telephony", "--regid=telephony", "--init-groups", "bvhelperctl", "ping", check=False)
     expect_equal(done.returncode, 4, "an account that is not in the group")
@@ -1093,7 +1113,7 @@ def remove():
     running = []
     for each in glob.glob("/proc/[0-9]*/comm"):
         with contextlib.suppress(FileNotFoundError, ProcessLookupError):  # a process that has ended since it was listed
-            if pathlib.Path(each).read_text() in ("BrenvikMobileHe\n", "brenvik-network\n", "brenvik-store-w\n"):
+            if pathlib.Path(each).read_text() in ("BrenvikMobileHe\n", "brenvik-caller-\n", "brenvik-network\n", "brenvik-store-w\n"):
                 running.append(each)
     expect_equal(running, [], "none is left running")
     expect_equal(bvhelperctl("ping", check=False).returncode, 5, "no helper")
@@ -1118,7 +1138,8 @@ def main():
     steps = [install, passes_its_own_smoke_test, refused_without_an_entitlement, served_with_one, python_works, works_in_its_sandbox,
              stores_no_preference_where_it_would_be_lost, works_for_the_whole_phone,
              asks_the_network, beats_over_the_cellular_link, held_in_its_sandbox,
-             a_helper_that_was_taken_over_is_held, a_network_worker_that_was_taken_over_is_held,
+             a_helper_that_was_taken_over_is_held, a_caller_worker_that_was_taken_over_is_held,
+             a_network_worker_that_was_taken_over_is_held,
              a_store_worker_that_was_taken_over_is_held, serves_without_the_account_mobile,
              only_root_reaches_a_worker,
              other_accounts_are_told_apart, the_handbook_is_whole, a_telephony_daemon_without_rights_lives_with_it,

@@ -13,6 +13,7 @@ import os
 import socket
 import sys
 
+CALLERS = "/run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper.callers"
 LIBC = ctypes.CDLL(None, use_errno=True)
 PROCESS_VM_READV, PROCESS_VM_WRITEV, PTRACE, PIDFD_OPEN, PIDFD_GETFD = 310, 311, 101, 434, 438
 
@@ -58,6 +59,21 @@ def written(folder):
     os.unlink(path)
 
 
+def told(folder):
+    """What the caller worker says about a process's folder in /proc; empty when it hangs up."""
+    with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as worker:
+        worker.connect(CALLERS)
+        ours, theirs = socket.socketpair(socket.AF_UNIX, socket.SOCK_SEQPACKET)
+        with ours, theirs:
+            ours.settimeout(20)
+            socket.send_fds(worker, [b"\1\0\0\0"], [theirs.fileno()])
+            theirs.close()
+            descriptor = os.open(folder, os.O_PATH)
+            socket.send_fds(ours, [b"\1\0\0\0"], [descriptor])
+            os.close(descriptor)
+            return ours.recv(65536).decode("latin-1")
+
+
 def writable_places():
     """Every folder in which a file could be made, without those inside another one of them."""
     found = []
@@ -94,6 +110,14 @@ def main():
     # The way around: another process's root, and what is mounted there.
     result["around"] = attempt(lambda: sorted(os.listdir("/proc/1/root/home")))
     result["memory_around"] = attempt(writes_memory, f"/proc/1/root/proc/{victim}/mem")
+    # What it is told of another process's program, and of a link that somebody else could have made.
+    result["told"] = attempt(told, f"/proc/{victim}")
+    folder = "/tmp/brenvik-probe"
+    if attempt(os.mkdir, folder) == "done":
+        os.symlink("/proc/1/root/etc/hostname", folder + "/exe")
+        result["told_of_a_link"] = attempt(told, folder)
+        os.unlink(folder + "/exe")
+        os.rmdir(folder)
     print(json.dumps({key: "done" if isinstance(value, socket.socket) else value for key, value in result.items()}))
 
 

@@ -58,6 +58,7 @@ class InstalledTree(unittest.TestCase):
 
     def test_programs_libraries_and_units_are_there(self):
         for pattern in (r"libexec/brenvik/BrenvikMobileHelper", r"libexec/brenvik/brenvik-archive-reader",
+                        r"libexec/brenvik/brenvik-caller-worker",
                         r"libexec/brenvik/brenvik-network-worker", r"libexec/brenvik/brenvik-store-worker",
                         r"bin/bvhelperctl", r"bin/brenvik-standin",
                         r"lib.*/libbrenvik-mobile-helper\.a",
@@ -75,6 +76,8 @@ class InstalledTree(unittest.TestCase):
                         r"lib/systemd/system/brenvik-mobile-helper\.service",
                         r"lib/systemd/system/brenvik-mobile-helper-restore\.service",
                         r"libexec/brenvik/brenvik-network-worker", r"libexec/brenvik/brenvik-store-worker",
+                        r"lib/systemd/system/brenvik-caller-worker\.socket",
+                        r"lib/systemd/system/brenvik-caller-worker\.service",
                         r"lib/systemd/system/brenvik-network-worker\.socket",
                         r"lib/systemd/system/brenvik-network-worker\.service",
                         r"lib/systemd/system/brenvik-store-worker\.socket",
@@ -121,7 +124,7 @@ class InstalledTree(unittest.TestCase):
         self.assertEqual([each for each in self.files if re.search(r"test|fake|geocoder|fuzz|command-pages", each, re.I)], [])
 
     def test_the_units_start_the_installed_programs(self):
-        for name in ("brenvik-mobile-helper", "brenvik-network-worker", "brenvik-store-worker"):
+        for name in ("brenvik-mobile-helper", "brenvik-caller-worker", "brenvik-network-worker", "brenvik-store-worker"):
             unit = self.one(rf"lib/systemd/system/{name}\.service").read_text()
             program = re.search(r"^ExecStart=(\S+)$", unit, flags=re.M)[1]
             self.assertTrue((self.root / program[1:]).is_file(), program)

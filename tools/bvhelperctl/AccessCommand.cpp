@@ -46,23 +46,18 @@ const char* nameOf(Kind kind) {
 // A program that is not running: what the helper would see if it were.
 class ImaginedCaller final : public EntitlementCandidate {
  public:
-  ImaginedCaller(std::string path, uid_t uid, std::string unit)
-      : path_(std::move(path)), uid_(uid), unit_(std::move(unit)) {
+  ImaginedCaller(const std::string& path, uid_t uid, std::string unit) : uid_(uid), unit_(std::move(unit)) {
     struct stat facts {};
-    if (::stat(path_.c_str(), &facts) == 0) executable_ = {facts.st_dev, facts.st_ino};
+    if (::stat(path.c_str(), &facts) == 0) executable_ = {facts.st_dev, facts.st_ino};
   }
   uid_t uid() const noexcept override { return uid_; }
-  const std::optional<CallerProcess::FileIdentity>& executable() noexcept override { return executable_; }
-  UniqueFd openExecutable() noexcept override {
-    return UniqueFd(::open(path_.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-  }
+  const std::optional<FileIdentity>& executable() override { return executable_; }
   const std::string& unit() override { return unit_; }
 
  private:
-  const std::string path_;
   const uid_t uid_;
   const std::string unit_;
-  std::optional<CallerProcess::FileIdentity> executable_;
+  std::optional<FileIdentity> executable_;
 };
 
 // The interpreter that the kernel starts for a script; nothing when the file is no script.

@@ -3,11 +3,10 @@
 #include "platform/security/linux/CallerProcess.h"
 
 #include <fcntl.h>
-#include <limits.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <array>
+#include <cerrno>
 
 namespace brenvik {
 namespace {
@@ -56,16 +55,11 @@ std::string_view unitOfCgroups(std::string_view text) noexcept {
   return unitOfCgroup(path);
 }
 
-std::optional<CallerProcess::FileIdentity> CallerProcess::identityAt(int folder, const char* path) noexcept {
-  struct stat facts {};
-  if (::fstatat(folder, path, &facts, 0) != 0) return std::nullopt;
-  return FileIdentity{facts.st_dev, facts.st_ino};
-}
-
-std::optional<CallerProcess> CallerProcess::pin(const std::string& proc, pid_t pid, std::uint32_t startTime) {
+std::optional<CallerProcess> CallerProcess::pin(const std::string& proc, pid_t pid, std::uint32_t startTime,
+                                                CallerReader* reader) {
   if (pid <= 0) return std::nullopt;
   const std::string path = proc + '/' + std::to_string(pid);
-  CallerProcess process(UniqueFd(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC)));
+  CallerProcess process(UniqueFd(::open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC)), reader);
   if (!process.folder_.isValid() || !process.runsSince(startTime)) return std::nullopt;
   return process;
 }
@@ -79,26 +73,31 @@ bool CallerProcess::runsSince(std::uint32_t startTime) const noexcept {
   return facts && facts->startTime == startTime && facts->state != 'Z' && facts->state != 'X';
 }
 
-std::optional<CallerProcess::FileIdentity> CallerProcess::executable() const noexcept {
-  return identityAt(folder_.get(), "exe");
+// Nothing when this process needs no help, or there is none.
+std::optional<CallerFacts> CallerProcess::ask() const {
+  return errno == EACCES && reader_ != nullptr ? reader_->read(folder_.get()) : std::nullopt;
+}
+
+std::optional<FileIdentity> CallerProcess::executable() const {
+  if (const auto found = identityAt(folder_.get(), "exe")) return found;
+  const auto told = ask();
+  return told ? told->executable : std::nullopt;
 }
 
 std::string CallerProcess::executablePath() const {
-  std::array<char, PATH_MAX> path;
-  const ssize_t size = ::readlinkat(folder_.get(), "exe", path.data(), path.size());
-  return size > 0 ? std::string(path.data(), static_cast<std::size_t>(size)) : std::string();
+  if (auto found = executablePathOf(folder_.get()); !found.empty()) return found;
+  auto told = ask();
+  return told ? std::move(told->executablePath) : std::string();
 }
 
-std::optional<CallerProcess::FileIdentity> CallerProcess::userNamespace() const noexcept {
-  return identityAt(folder_.get(), "ns/user");
+std::optional<FileIdentity> CallerProcess::userNamespace() const {
+  if (const auto found = identityAt(folder_.get(), "ns/user")) return found;
+  const auto told = ask();
+  return told ? told->userNamespace : std::nullopt;
 }
 
-std::optional<CallerProcess::FileIdentity> CallerProcess::namespaceOfThisProcess(const std::string& proc) {
+std::optional<FileIdentity> CallerProcess::namespaceOfThisProcess(const std::string& proc) {
   return identityAt(AT_FDCWD, (proc + "/self/ns/user").c_str());
-}
-
-UniqueFd CallerProcess::openExecutable() const noexcept {
-  return UniqueFd(::openat(folder_.get(), "exe", O_RDONLY | O_NONBLOCK | O_CLOEXEC));
 }
 
 std::string CallerProcess::unit() const {

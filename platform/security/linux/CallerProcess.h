@@ -11,6 +11,7 @@
 
 #include "platform/base/ProcessFacts.h"
 #include "platform/base/UniqueFd.h"
+#include "platform/security/linux/CallerReader.h"
 
 namespace brenvik {
 
@@ -24,38 +25,33 @@ std::string_view unitOfCgroup(std::string_view path) noexcept;
 std::string_view unitOfCgroups(std::string_view text) noexcept;
 
 // One process, held by its open folder in /proc. A process that gets the same id later has another folder, so
-// the two are never mixed up. Any call may find that the process has exited. One thread at a time; throws
-// only std::bad_alloc.
+// the two are never mixed up. Any call may find that the process has exited. What this process may not read
+// by itself, it has the reader read. One thread at a time; throws only std::bad_alloc.
 class CallerProcess {
  public:
-  struct FileIdentity {
-    dev_t device;
-    ino_t inode;
-    bool operator==(const FileIdentity&) const = default;
-  };
-
   // Returns nothing if there is no such process, or it started at another time. `proc` is "/proc" (except in
-  // tests).
-  static std::optional<CallerProcess> pin(const std::string& proc, pid_t pid, std::uint32_t startTime);
+  // tests). `reader` must outlive this object; null: there is none.
+  static std::optional<CallerProcess> pin(const std::string& proc, pid_t pid, std::uint32_t startTime,
+                                          CallerReader* reader = nullptr);
 
   // The file that the process executes now; nothing if it has exited, even if it is still a zombie.
-  std::optional<FileIdentity> executable() const noexcept;
-  // The same, open for reading; invalid if it cannot be opened.
-  UniqueFd openExecutable() const noexcept;
+  std::optional<FileIdentity> executable() const;
   // The path of that file according to the kernel; empty if unknown.
   std::string executablePath() const;
   // The unit of the service manager that it runs in; empty if none or unknown.
   std::string unit() const;
   // Its user namespace; nothing if it has exited or may not be inspected.
-  std::optional<FileIdentity> userNamespace() const noexcept;
+  std::optional<FileIdentity> userNamespace() const;
   static std::optional<FileIdentity> namespaceOfThisProcess(const std::string& proc);
 
  private:
-  explicit CallerProcess(UniqueFd folder) noexcept : folder_(std::move(folder)) {}
+  CallerProcess(UniqueFd folder, CallerReader* reader) noexcept
+      : folder_(std::move(folder)), reader_(reader) {}
   bool runsSince(std::uint32_t startTime) const noexcept;
-  static std::optional<FileIdentity> identityAt(int folder, const char* path) noexcept;
+  std::optional<CallerFacts> ask() const;
 
   UniqueFd folder_;
+  CallerReader* reader_;
 };
 
 }  // namespace brenvik

@@ -40,11 +40,10 @@ class EntitlementFiles::Task final : public SecurityTask, private EntitlementCan
 
  private:
   uid_t uid() const noexcept override { return uid_; }
-  const std::optional<CallerProcess::FileIdentity>& executable() noexcept override {
+  const std::optional<FileIdentity>& executable() override {
     if (!executable_) executable_ = process_.executable();
     return executable_;
   }
-  UniqueFd openExecutable() noexcept override { return process_.openExecutable(); }
   const std::string& unit() override {
     if (!unit_) unit_ = process_.unit();
     return *unit_;
@@ -53,19 +52,19 @@ class EntitlementFiles::Task final : public SecurityTask, private EntitlementCan
   EntitlementSearch& search_;
   const CallerProcess process_;
   const uid_t uid_;
-  std::optional<CallerProcess::FileIdentity> executable_;  // asked for once
-  std::optional<std::string> unit_;                        // the same
+  std::optional<FileIdentity> executable_;  // asked for once
+  std::optional<std::string> unit_;         // the same
 };
 
-EntitlementFiles::EntitlementFiles(AccountDirectory& accounts)
-    : EntitlementFiles(accounts, entitlementDirectories()) {}
+EntitlementFiles::EntitlementFiles(AccountDirectory& accounts, CallerReader* reader)
+    : EntitlementFiles(accounts, entitlementDirectories(), "/proc", reader) {}
 
 EntitlementFiles::EntitlementFiles(AccountDirectory& accounts, std::vector<std::string> directories,
-                                   std::string proc)
-    : search_(accounts, std::move(directories)), proc_(std::move(proc)) {}
+                                   std::string proc, CallerReader* reader)
+    : search_(accounts, std::move(directories)), proc_(std::move(proc)), reader_(reader) {}
 
 std::unique_ptr<SecurityTask> EntitlementFiles::makeTask(const AuditToken& caller) noexcept try {
-  auto process = CallerProcess::pin(proc_, caller.pid(), caller.pidVersion());
+  auto process = CallerProcess::pin(proc_, caller.pid(), caller.pidVersion(), reader_);
   if (!process || !isInOurNamespace(*process)) return nullptr;
   return std::make_unique<Task>(search_, std::move(*process), caller.uid());
 } catch (...) {
@@ -73,7 +72,7 @@ std::unique_ptr<SecurityTask> EntitlementFiles::makeTask(const AuditToken& calle
 }
 
 std::string EntitlementFiles::explainNoTask(const AuditToken& caller) noexcept try {
-  const auto process = CallerProcess::pin(proc_, caller.pid(), caller.pidVersion());
+  const auto process = CallerProcess::pin(proc_, caller.pid(), caller.pidVersion(), reader_);
   if (!process) return "the caller has ended";
   if (!process->userNamespace()) return "the caller's user namespace cannot be told";
   return isInOurNamespace(*process) ? "the caller cannot be examined now"

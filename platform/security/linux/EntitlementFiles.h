@@ -18,10 +18,11 @@ class EntitlementFiles final : public TaskSecurity {
  public:
   // Uses the directories named at build time (BRENVIK_ENTITLEMENT_DIRECTORIES). `accounts` must outlive this
   // object, which must outlive its tasks.
-  explicit EntitlementFiles(AccountDirectory& accounts);
-  // Earlier directories first. `proc` is where proc(5) is mounted.
+  explicit EntitlementFiles(AccountDirectory& accounts, CallerReader* reader = nullptr);
+  // Earlier directories first. `proc` is where proc(5) is mounted. `reader` reads what this process may not
+  // read by itself, and must outlive this object and its tasks; null: there is none.
   EntitlementFiles(AccountDirectory& accounts, std::vector<std::string> directories,
-                   std::string proc = "/proc");
+                   std::string proc = "/proc", CallerReader* reader = nullptr);
 
   std::unique_ptr<SecurityTask> makeTask(const AuditToken& caller) noexcept override;
   std::string explainNoTask(const AuditToken& caller) noexcept override;
@@ -32,6 +33,7 @@ class EntitlementFiles final : public TaskSecurity {
 
   EntitlementSearch search_;
   const std::string proc_;
+  CallerReader* const reader_;
 };
 
 }  // namespace brenvik

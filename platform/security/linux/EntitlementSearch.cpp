@@ -394,11 +394,12 @@ class EntitlementSearch::Run {
     if (!isRootsAlone(walked.facts)) return distrustExecutable(walked.place);
     search_.forget(path_);  // nothing is wrong with it any more
     const auto& running = candidate_.executable();
-    if (!running || *running != CallerProcess::FileIdentity{walked.facts.st_dev, walked.facts.st_ino}) {
+    if (!running || *running != FileIdentity{walked.facts.st_dev, walked.facts.st_ino}) {
       tell("Executable", Kind::differs, [&] { return "is " + path + ", and the caller runs another file"; });
       return Verdict::passedOver;
     }
     tell("Executable", Kind::holds, [&] { return "is " + path; });
+    executable_ = walked.place;
     return Verdict::matches;
   }
 
@@ -426,13 +427,14 @@ class EntitlementSearch::Run {
       tell("SHA256", Kind::unknown, why);
       return Verdict::undecidable;
     };
-    const UniqueFd fd = candidate_.openExecutable();
-    if (!fd.isValid() && (errno == ENOENT || errno == ESRCH)) return hasChanged();
+    // By its own path, which only root can lead elsewhere: through the caller's link in /proc the file would
+    // come open with the rights of the caller's mounts.
+    const UniqueFd fd(::openat(AT_FDCWD, executable_.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    if (!fd.isValid() && errno == ENOENT) return hasChanged();
     struct stat facts {};
     if (::fstat(fd.get(), &facts) != 0) return cannotTell("cannot be compared: the file cannot be read");
-    // It may have become another program since it was compared.
-    if (candidate_.executable() != CallerProcess::FileIdentity{facts.st_dev, facts.st_ino})
-      return hasChanged();
+    // The path may lead to another file since it was compared.
+    if (candidate_.executable() != FileIdentity{facts.st_dev, facts.st_ino}) return hasChanged();
     const auto digest = sha256OfFile(fd.get());
     if (!digest) return cannotTell("cannot be compared: the file or libcrypto cannot be read");
     if (*digest == wanted) {
@@ -451,8 +453,9 @@ class EntitlementSearch::Run {
   const std::string_view name_;
   EntitlementCandidate& candidate_;
   std::vector<EntitlementFinding>* const findings_;
-  std::string path_;  // of what is looked at now
-  FileState state_;   // of the same
+  std::string path_;        // of what is looked at now
+  FileState state_;         // of the same
+  std::string executable_;  // without links: what the file names, after it was found to be the candidate's
   Result result_;
 };
 

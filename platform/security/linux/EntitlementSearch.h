@@ -27,9 +27,7 @@ class EntitlementCandidate {
   virtual uid_t uid() const noexcept = 0;
   // The file that it executes, the same for the life of this object; nothing if there is none or it is
   // unknown.
-  virtual const std::optional<CallerProcess::FileIdentity>& executable() noexcept = 0;
-  // The file that it executes now, open for reading. Returns an invalid descriptor and sets errno on failure.
-  virtual UniqueFd openExecutable() noexcept = 0;
+  virtual const std::optional<FileIdentity>& executable() = 0;
   // Its unit of the system's service manager; empty: none.
   virtual const std::string& unit() = 0;
 };

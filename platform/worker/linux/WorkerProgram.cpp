@@ -165,7 +165,8 @@ WorkerResult WorkerProgram::connectToService() {
   int error = 0;
   if (connectSocket(socket.get(), *address) != 0) {
     error = errno;
-    if (error == ENOENT || error == ECONNREFUSED) return WorkerResult::closed;
+    if ((error == ENOENT || error == ECONNREFUSED) && !description_.isOnlyService)
+      return WorkerResult::closed;
   } else {
     const auto peer = peerOf(socket.get());
     if (!peer) error = errno;

@@ -17,9 +17,9 @@
 namespace brenvik {
 
 // One worker, behind the socket of its named service. If nobody listens there, the worker is a child of this
-// process: the program beside this one, or the installed one. The first open() connects or starts it, and so
-// does the first open() after the worker's death. Failures are logged, with a limit on lines in a row. Any
-// thread.
+// process (the program beside this one, or the installed one), unless it is a service only. The first open()
+// connects or starts it, and so does the first open() after the worker's death. Failures are logged, with a
+// limit on lines in a row. Any thread.
 class WorkerProgram final : public Worker {
  public:
   struct Description {
@@ -28,6 +28,8 @@ class WorkerProgram final : public Worker {
     std::string bootstrap;  // folder of the services' sockets
     // Folders that may hold the program, best first; if empty, those of workerProgramFolders().
     std::vector<std::string> folders;
+    // It is never started as a child: this process could not give it the rights that it needs.
+    bool isOnlyService = false;
   };
   using Clock = std::chrono::steady_clock;
 

@@ -584,6 +584,20 @@ TEST_F(WorkerServiceTest, ASocketThatNobodyListensBehindIsAsGoodAsNone) {
   EXPECT_TRUE(works(worker));
 }
 
+TEST_F(WorkerServiceTest, AServiceIsNoChildOfThisProcess) {
+  WorkerProgram::Description service = description();
+  service.isOnlyService = true;
+  WorkerProgram worker(service);
+  WorkerChannel channel;
+  EXPECT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::unavailable);
+  listen().reset();
+  EXPECT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::unavailable);
+  const std::string beginning = "cannot connect to " + (folder / kService) + ": ";
+  EXPECT_EQ(lines(), (std::vector<std::string>{beginning + "No such file or directory",
+                                               beginning + "Connection refused"}));
+  EXPECT_TRUE(children().empty());
+}
+
 TEST_F(WorkerServiceTest, AQueueThatIsFullKeepsNobodyWaiting) {
   const UniqueFd socket = listen();
   WorkerProgram first(description());

@@ -21,6 +21,8 @@
 #include <cstring>
 #include <new>
 #include <optional>
+#include <utility>
+#include <vector>
 
 #include "platform/base/UniqueFd.h"
 
@@ -113,16 +115,12 @@ constexpr std::uint32_t kArchitecture = AUDIT_ARCH_AARCH64;
 constexpr std::uint32_t kArchitecture = 0;
 #endif
 
-// Refuses the calls with an error; everything else is as before. By hand, for a dozen calls.
-bool refuseForeignCalls() noexcept {
-  if (kArchitecture == 0) return true;
+constexpr std::uint32_t kAnd = SECCOMP_RET_ERRNO;
+
+// By hand, for a dozen calls. After it the number of the call is loaded.
+std::vector<sock_filter> beginningOfFilter() {
   constexpr std::uint32_t kOtherTable = 0x40000000;  // a second numbering of x86-64's calls
-  constexpr std::uint32_t kRefused[] = {
-      SYS_execve,         SYS_execveat,    SYS_ptrace, SYS_process_vm_readv, SYS_process_vm_writev,
-      SYS_io_uring_setup, SYS_pidfd_getfd, SYS_bpf,    SYS_userfaultfd,      SYS_mount,
-      SYS_unshare,        SYS_setns};
-  constexpr std::uint32_t kAnd = SECCOMP_RET_ERRNO;
-  std::vector<sock_filter> filter{
+  return {
       BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, arch)),
       BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, kArchitecture, 1, 0),
       BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_KILL_PROCESS),
@@ -130,17 +128,45 @@ bool refuseForeignCalls() noexcept {
       BPF_JUMP(BPF_JMP | BPF_JGE | BPF_K, kOtherTable, 0, 1),
       BPF_STMT(BPF_RET | BPF_K, kAnd | EPERM),
   };
-  for (const std::uint32_t call : kRefused) {
-    filter.push_back(BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, call, 0, 1));
-    filter.push_back(BPF_STMT(BPF_RET | BPF_K, kAnd | EPERM));
-  }
+}
+
+void decide(std::vector<sock_filter>* filter, std::uint32_t call, std::uint32_t decision) {
+  filter->push_back(BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, call, 0, 1));
+  filter->push_back(BPF_STMT(BPF_RET | BPF_K, decision));
+}
+
+bool install(std::vector<sock_filter> filter) noexcept {
+  const sock_fprog program{static_cast<unsigned short>(filter.size()), filter.data()};
+  return ::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program, 0, 0) == 0;
+}
+
+bool refuseAllBut(const std::vector<std::uint32_t>& calls) {
+#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
+  if (kArchitecture == 0) return false;
+  std::vector<sock_filter> filter = beginningOfFilter();
+  for (const std::uint32_t call : calls) decide(&filter, call, SECCOMP_RET_ALLOW);
+  filter.push_back(BPF_STMT(BPF_RET | BPF_K, kAnd | EPERM));
+  return install(std::move(filter));
+#else
+  return !calls.empty();
+#endif
+}
+
+// Refuses the calls with an error; everything else is as before.
+bool refuseForeignCalls() {
+  if (kArchitecture == 0) return true;
+  constexpr std::uint32_t kRefused[] = {
+      SYS_execve,         SYS_execveat,    SYS_ptrace, SYS_process_vm_readv, SYS_process_vm_writev,
+      SYS_io_uring_setup, SYS_pidfd_getfd, SYS_bpf,    SYS_userfaultfd,      SYS_mount,
+      SYS_unshare,        SYS_setns};
+  std::vector<sock_filter> filter = beginningOfFilter();
+  for (const std::uint32_t call : kRefused) decide(&filter, call, kAnd | EPERM);
   filter.push_back(BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_socket, 0, 3));
   filter.push_back(BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, args)));
   filter.push_back(BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, AF_UNIX, 1, 0));
   filter.push_back(BPF_STMT(BPF_RET | BPF_K, kAnd | EAFNOSUPPORT));
   filter.push_back(BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW));
-  const sock_fprog program{static_cast<unsigned short>(filter.size()), filter.data()};
-  return ::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program, 0, 0) == 0;
+  return install(std::move(filter));
 }
 
 // Leaves root's account; null, or in words what went wrong, as giveUpRights(). *kept are the capabilities
@@ -191,7 +217,9 @@ const char* giveUpRights(const WorkerRights& rights) noexcept try {
   }
   if (const char* const why = keepOnly(kept); why != nullptr) return why;
   if (const char* const why = setLimits(rights); why != nullptr) return why;
-  return !rights.isLocalOnly || refuseForeignCalls() ? nullptr : "system calls cannot be refused";
+  const bool areRefused = (!rights.isLocalOnly || refuseForeignCalls()) &&
+                          (rights.onlyCalls.empty() || refuseAllBut(rights.onlyCalls));
+  return areRefused ? nullptr : "system calls cannot be refused";
 } catch (const std::bad_alloc&) {
   return "out of memory";
 }

@@ -5,6 +5,7 @@
 #include <sys/resource.h>
 #include <sys/types.h>
 
+#include <cstdint>
 #include <functional>
 #include <string>
 #include <vector>
@@ -23,6 +24,9 @@ struct WorkerRights {
   // A system call filter (seccomp(2)) lets it open only local sockets, and forbids it to start programs and
   // to inspect other processes. There is no filter on architectures that it does not support.
   bool isLocalOnly = false;
+  // If not empty, a filter refuses every other call (EPERM), and the threads that there will be have it, too.
+  // Not with sanitizers, which need more calls.
+  std::vector<std::uint32_t> onlyCalls = {};
   rlim_t descriptors = 256;
   // Bytes of address space; 0: no limit. Ignored with sanitizers, whose shadow memory exceeds any limit.
   rlim_t addressSpace = 0;

@@ -149,6 +149,26 @@ TEST(WorkerRightsTest, ALocalWorkerStartsNoProgramAndLooksIntoNoProcess) {
             }),
             0);
 }
+
+#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
+TEST(WorkerRightsTest, AWorkerThatNamesItsCallsMayMakeNoOther) {
+  EXPECT_EQ(inProcess([] {
+              WorkerRights rights = ofNobody();
+              rights.isLocalOnly = true;
+              rights.onlyCalls = {SYS_getpid, SYS_exit_group};
+              if (giveUpRights(rights) != nullptr) return 1;
+              if (::syscall(SYS_getpid) <= 0) return 2;
+              int at = 10;
+              for (const long call : {SYS_openat, SYS_openat2, SYS_read, SYS_write, SYS_getppid, SYS_socket,
+                                      SYS_prctl, SYS_seccomp, SYS_execve, SYS_kill}) {
+                if (::syscall(call, 0, 0, 0, 0, 0, 0) != -1 || errno != EPERM) return at;
+                ++at;
+              }
+              return 0;
+            }),
+            0);
+}
+#endif
 #endif
 
 #if defined(__x86_64__)

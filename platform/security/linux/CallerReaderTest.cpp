@@ -1,0 +1,263 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "platform/security/linux/CallerReader.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <limits.h>
+#include <linux/capability.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <functional>
+#include <new>
+#include <utility>
+
+#include "platform/base/ProcessFacts.h"
+#include "platform/security/linux/CallerProcess.h"
+#include "platform/worker/fakes/ThreadedWorker.h"
+
+namespace brenvik {
+namespace {
+
+constexpr auto kForEver = std::chrono::steady_clock::time_point::max();
+
+CallerFacts someFacts() { return {FileIdentity{1, 2}, "/usr/bin/program", FileIdentity{3, 4}}; }
+
+// Answers each question with the message, until the helper hangs up.
+ThreadedWorker::Serve answering(const std::function<WorkerMessage()>& make) {
+  return [make](std::uint32_t, WorkerChannel channel) {
+    WorkerMessage question;
+    while (channel.receive(&question, kForEver) == WorkerResult::done) (void)channel.send(make());
+  };
+}
+
+class CallerReaderTest : public testing::Test {
+ protected:
+  std::optional<CallerFacts> ask(RemoteCallerReader& reader) { return reader.read(folder.get()); }
+  const UniqueFd folder{::open("/proc/self", O_PATH | O_CLOEXEC)};
+};
+
+TEST_F(CallerReaderTest, TheAnswerOfTheWorkerIsTaken) {
+  std::atomic<int> questions = 0;
+  ThreadedWorker worker([&](std::uint32_t work, WorkerChannel channel) {
+    EXPECT_EQ(work, callers::kFacts);
+    WorkerMessage question;
+    while (channel.receive(&question, kForEver) == WorkerResult::done) {
+      EXPECT_TRUE(callers::isQuestion(question));
+      EXPECT_EQ(identityAt(question.descriptors[0].get(), "exe"), identityAt(AT_FDCWD, "/proc/self/exe"));
+      ++questions;
+      (void)channel.send(callers::encode(someFacts()));
+    }
+  });
+  RemoteCallerReader reader(worker);
+  for (int i = 0; i < 3; ++i) {
+    const auto facts = ask(reader);
+    ASSERT_TRUE(facts);
+    EXPECT_EQ(facts->executable, (FileIdentity{1, 2}));
+    EXPECT_EQ(facts->executablePath, "/usr/bin/program");
+    EXPECT_EQ(facts->userNamespace, (FileIdentity{3, 4}));
+  }
+  EXPECT_EQ(questions, 3);
+  EXPECT_EQ(worker.opened(), 1) << "one channel for all";
+}
+
+TEST_F(CallerReaderTest, WhatTheWorkerDoesNotKnowIsNotKnown) {
+  ThreadedWorker worker(answering([] { return callers::encode({}); }));
+  RemoteCallerReader reader(worker);
+  const auto facts = ask(reader);
+  ASSERT_TRUE(facts);
+  EXPECT_FALSE(facts->executable);
+  EXPECT_EQ(facts->executablePath, "");
+  EXPECT_FALSE(facts->userNamespace);
+}
+
+TEST_F(CallerReaderTest, AWorkerThatDiedBetweenTwoQuestionsIsReplaced) {
+  ThreadedWorker worker(answering([] { return callers::encode(someFacts()); }));
+  RemoteCallerReader reader(worker);
+  EXPECT_TRUE(ask(reader));
+  worker.die();
+  EXPECT_TRUE(ask(reader));
+  EXPECT_EQ(worker.opened(), 2);
+}
+
+TEST_F(CallerReaderTest, AWorkerThatDiesOfAQuestionIsReplacedOnceAndTheNextQuestionHasAnother) {
+  std::atomic<int> deaths = 0;
+  ThreadedWorker worker([&](std::uint32_t, WorkerChannel channel) {
+    WorkerMessage question;
+    while (channel.receive(&question, kForEver) == WorkerResult::done) {
+      if (deaths++ < 3) return;  // the channel hangs up
+      (void)channel.send(callers::encode(someFacts()));
+    }
+  });
+  RemoteCallerReader reader(worker);
+  EXPECT_FALSE(ask(reader)) << "two died of it";
+  EXPECT_TRUE(ask(reader)) << "one more died, and its successor answers";
+  EXPECT_EQ(worker.opened(), 4);
+}
+
+TEST_F(CallerReaderTest, AWorkerThatHangsIsGivenUpInTimeAndTheNextQuestionHasAnother) {
+  std::atomic<int> served = 0;
+  ThreadedWorker worker([&](std::uint32_t, WorkerChannel channel) {
+    const bool hangs = served++ == 0;
+    WorkerMessage question;
+    while (channel.receive(&question, kForEver) == WorkerResult::done) {
+      if (!hangs) (void)channel.send(callers::encode(someFacts()));
+    }
+  });
+  {
+    RemoteCallerReader reader(worker, std::chrono::milliseconds(1));
+    EXPECT_FALSE(ask(reader));
+    EXPECT_EQ(worker.givenUp(), 1);
+  }
+  RemoteCallerReader reader(worker);
+  EXPECT_TRUE(ask(reader));
+}
+
+TEST_F(CallerReaderTest, AnAnswerOfAnotherFormIsNoneAndItsWorkerIsGivenUp) {
+  const auto lies = [&](const char* what, const std::function<void(WorkerMessage*)>& change) {
+    ThreadedWorker worker(answering([&] {
+      WorkerMessage answer = callers::encode(someFacts());
+      change(&answer);
+      return answer;
+    }));
+    RemoteCallerReader reader(worker);
+    EXPECT_FALSE(ask(reader)) << what;
+    EXPECT_EQ(worker.givenUp(), 1) << what;
+    EXPECT_EQ(worker.opened(), 1) << what << ": a liar is not asked again";
+  };
+  lies("another kind", [](WorkerMessage* answer) { answer->kind = 7; });
+  lies("nothing in it", [](WorkerMessage* answer) { answer->payload.clear(); });
+  lies("cut short", [](WorkerMessage* answer) { answer->payload.pop_back(); });
+  lies("more than there should be", [](WorkerMessage* answer) { answer->payload.push_back({}); });
+  lies("neither yes nor no", [](WorkerMessage* answer) { answer->payload[0] = std::byte{2}; });
+  lies("a descriptor", [](WorkerMessage* answer) {
+    answer->descriptors.emplace_back(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+  });
+  lies("a path that the kernel cannot have told", [](WorkerMessage* answer) {
+    CallerFacts facts = someFacts();
+    facts.executablePath.assign(PATH_MAX + 1, 'x');
+    *answer = callers::encode(facts);
+  });
+}
+
+TEST_F(CallerReaderTest, WithoutAWorkerThereIsNoAnswer) {
+  ThreadedWorker worker(answering([] { return callers::encode(someFacts()); }));
+  worker.answerWith(WorkerResult::unavailable);
+  RemoteCallerReader reader(worker);
+  EXPECT_FALSE(ask(reader));
+  worker.answerWith(WorkerResult::done);
+  EXPECT_TRUE(ask(reader));
+}
+
+TEST_F(CallerReaderTest, ALackOfMemoryOrDescriptorsIsThisProcesssOwn) {
+  ThreadedWorker worker(answering([] { return callers::encode(someFacts()); }));
+  RemoteCallerReader reader(worker);
+  worker.answerWith(WorkerResult::outOfMemory);
+  EXPECT_THROW((void)ask(reader), std::bad_alloc);
+  EXPECT_THROW((void)reader.read(-1), std::bad_alloc);
+  EXPECT_EQ(worker.givenUp(), 0);
+  worker.answerWith(WorkerResult::done);
+  EXPECT_TRUE(ask(reader));
+}
+
+// ----- A process that may not look at others -----
+
+class AnsweringReader final : public CallerReader {
+ public:
+  std::optional<CallerFacts> read(int folder) override {
+    ++asked;
+    struct stat facts {};
+    isFolder = ::fstat(folder, &facts) == 0 && S_ISDIR(facts.st_mode);
+    return answer;
+  }
+  std::optional<CallerFacts> answer = someFacts();
+  int asked = 0;
+  bool isFolder = false;
+};
+
+// The exit status of `work`, run in a child of no capability.
+int withoutCapabilities(const std::function<int()>& work) {
+  const pid_t child = ::fork();
+  if (child == 0) {
+    __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+    __user_cap_data_struct none[_LINUX_CAPABILITY_U32S_3] = {};
+    ::_exit(::syscall(SYS_capset, &header, none) == 0 ? work() : 99);
+  }
+  int status = 0;
+  if (::waitpid(child, &status, 0) != child || !WIFEXITED(status)) return -1;
+  return WEXITSTATUS(status);
+}
+
+bool isPowerful() {
+  __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+  __user_cap_data_struct data[_LINUX_CAPABILITY_U32S_3] = {};
+  return ::syscall(SYS_capget, &header, data) == 0 && (data[0].effective & (1U << CAP_SYS_PTRACE)) != 0;
+}
+
+TEST(CallerProcessWithAReaderTest, WhatThisProcessMayReadItReadsByItself) {
+  AnsweringReader reader;
+  const auto self = CallerProcess::pin("/proc", ::getpid(), processStartTime(::getpid()).value(), &reader);
+  ASSERT_TRUE(self);
+  EXPECT_EQ(self->executable(), identityAt(AT_FDCWD, "/proc/self/exe"));
+  EXPECT_TRUE(self->userNamespace());
+  EXPECT_NE(self->executablePath(), "");
+  EXPECT_EQ(reader.asked, 0);
+}
+
+TEST(CallerProcessWithAReaderTest, WhatItMayNotReadTheReaderReads) {
+  if (!isPowerful()) GTEST_SKIP() << "a process with fewer rights than this one cannot be made";
+  const pid_t powerful = ::getpid();
+  const auto startTime = processStartTime(powerful).value();
+  EXPECT_EQ(withoutCapabilities([&] {
+              AnsweringReader reader;
+              const auto process = CallerProcess::pin("/proc", powerful, startTime, &reader);
+              if (!process) return 1;
+              if (process->executable() != someFacts().executable || reader.asked != 1 || !reader.isFolder)
+                return 2;
+              if (process->executablePath() != someFacts().executablePath) return 3;
+              if (process->userNamespace() != someFacts().userNamespace) return 4;
+              reader.answer.reset();
+              if (process->executable() || process->userNamespace() || !process->executablePath().empty())
+                return 5;
+              return 0;
+            }),
+            0);
+}
+
+TEST(CallerProcessWithAReaderTest, WithoutAReaderItKnowsNothing) {
+  if (!isPowerful()) GTEST_SKIP() << "a process with fewer rights than this one cannot be made";
+  const pid_t powerful = ::getpid();
+  const auto startTime = processStartTime(powerful).value();
+  EXPECT_EQ(withoutCapabilities([&] {
+              const auto process = CallerProcess::pin("/proc", powerful, startTime);
+              if (!process) return 1;
+              if (process->executable() || process->userNamespace()) return 2;
+              return process->executablePath().empty() ? 0 : 3;
+            }),
+            0);
+}
+
+TEST(CallerProcessWithAReaderTest, NobodyIsAskedAboutAProcessThatHasGone) {
+  const pid_t child = ::fork();
+  if (child == 0) {
+    ::pause();
+    ::_exit(0);
+  }
+  ASSERT_GT(child, 0);
+  AnsweringReader reader;
+  const auto process = CallerProcess::pin("/proc", child, processStartTime(child).value(), &reader);
+  ASSERT_TRUE(process);
+  ::kill(child, SIGKILL);
+  ASSERT_EQ(::waitpid(child, nullptr, 0), child);
+  EXPECT_FALSE(process->executable());
+  EXPECT_FALSE(process->userNamespace());
+  EXPECT_EQ(process->executablePath(), "");
+  EXPECT_EQ(reader.asked, 0);
+}
+
+}  // namespace
+}  // namespace brenvik
