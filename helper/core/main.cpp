@@ -95,6 +95,7 @@ class Serving {
                                       .preferences = preferences_,
                                       .messagePorts = messagePorts_});
     CellularHeartbeat::shared().configure({.queues = queues_, .network = echoNetwork_});
+    startStoreWorkerAhead();
   }
   Serving(const Serving&) = delete;
   Serving& operator=(const Serving&) = delete;
@@ -116,6 +117,13 @@ class Serving {
   }
 
  private:
+  // Where there is a voicemail store, its first use need not wait for the worker's start. That comes after
+  // the reply to the request by which this object was made. See docs/decisions/13-workers.md.
+  void startStoreWorkerAhead() noexcept try {
+    if (voicemailStore_.isThere()) queues_.main().post([this] { storeWorker_.start(); });
+  } catch (const std::bad_alloc&) {  // then the first use starts it
+  }
+
   MobileAccount account() const { return {mobile_.homeDirectory(), mobile_.uid(), mobile_.gid()}; }
   PreparedFolder::Account storeAccount() const {
     const char* const home = mobile_.homeDirectory();

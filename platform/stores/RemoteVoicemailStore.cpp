@@ -3,6 +3,7 @@
 #include "platform/stores/RemoteVoicemailStore.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 
 #include <new>
 #include <utility>
@@ -106,6 +107,13 @@ RemoteVoicemailStore::Received RemoteVoicemailStore::ask(VoicemailRequest* reque
   // Nobody would know what an answer that comes later answers.
   worker_.giveUp(&channel_);
   return received == WorkerResult::closed ? Received::workerDied : Received::nothing;
+}
+
+bool RemoteVoicemailStore::isThere() noexcept {
+  StoreFolder::Opened folder;
+  struct stat info {};
+  return folder_.open(StoreFolder::IfMissing::fail, &folder) == StoreFolder::State::open &&
+         ::fstatat(folder.descriptor.get(), stores::kVoicemailFile, &info, AT_SYMLINK_NOFOLLOW) == 0;
 }
 
 std::optional<std::string> RemoteVoicemailStore::perform(Operation operation, const std::string* key,

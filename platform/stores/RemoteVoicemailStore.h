@@ -27,6 +27,9 @@ class RemoteVoicemailStore final : public VoicemailStore {
   RemoteVoicemailStore(Worker& worker, StoreFolder& folder, std::chrono::milliseconds patience = kPatience)
       : worker_(worker), folder_(folder), patience_(patience) {}
 
+  // Whether there is a store: a file with its name, whatever it holds. Asks the file system, not the worker.
+  bool isThere() noexcept;
+
   void setToken(const std::string* token) override;
   void setTokenForKey(const std::string& key, const std::string& token) override;
   void removeAllRecords() override;

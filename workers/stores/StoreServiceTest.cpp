@@ -125,6 +125,16 @@ TEST_F(StoreServiceTest, ReadingAStoreThatIsNotThereAsksNobody) {
   EXPECT_TRUE(log.entries().empty());
 }
 
+TEST_F(StoreServiceTest, WhetherThereIsAStoreIsKnownWithoutTheWorker) {
+  EXPECT_FALSE(store.isThere());
+  home.directory("Library/Voicemail");
+  EXPECT_FALSE(store.isThere()) << "a folder is no store";
+  store.setToken(&token);
+  const int opened = worker.opened();
+  EXPECT_TRUE(store.isThere());
+  EXPECT_EQ(worker.opened(), opened);
+}
+
 TEST_F(StoreServiceTest, AFolderThatWasReplacedIsTheOneThatCounts) {
   store.setToken(&token);
   std::filesystem::rename(home / "Library/Voicemail", home / "moved");
