@@ -117,8 +117,8 @@ class Serving {
   }
 
  private:
-  // Where there is a voicemail store, its first use need not wait for the worker's start. That comes after
-  // the reply to the request by which this object was made. See docs/decisions/13-workers.md.
+  // If there is a voicemail store, starts its worker, so that the first use does not wait for that. Posted, so
+  // that the client whose request made this object gets its reply first. See docs/decisions/13-workers.md.
   void startStoreWorkerAhead() noexcept try {
     if (voicemailStore_.isThere()) queues_.main().post([this] { storeWorker_.start(); });
   } catch (const std::bad_alloc&) {  // then the first use starts it
