@@ -95,7 +95,6 @@ class Serving {
                                       .preferences = preferences_,
                                       .messagePorts = messagePorts_});
     CellularHeartbeat::shared().configure({.queues = queues_, .network = echoNetwork_});
-    startStoreWorkerAhead();
   }
   Serving(const Serving&) = delete;
   Serving& operator=(const Serving&) = delete;
@@ -117,13 +116,6 @@ class Serving {
   }
 
  private:
-  // If there is a voicemail store, starts its worker, so that the first use does not wait for that. Posted, so
-  // that the client whose request made this object gets its reply first. See docs/decisions/13-workers.md.
-  void startStoreWorkerAhead() noexcept try {
-    if (voicemailStore_.isThere()) queues_.main().post([this] { storeWorker_.start(); });
-  } catch (const std::bad_alloc&) {  // then the first use starts it
-  }
-
   MobileAccount account() const { return {mobile_.homeDirectory(), mobile_.uid(), mobile_.gid()}; }
   PreparedFolder::Account storeAccount() const {
     const char* const home = mobile_.homeDirectory();

@@ -14,7 +14,7 @@ import subprocess
 import time
 
 import wire
-from harness import BUILD, ERROR, Daemon, HelperTest, as_account, eventually, listen, main
+from harness import BUILD, ERROR, HelperTest, as_account, eventually, listen, main
 from intrusion import tell_ways_into, ways_into
 
 HOME = pathlib.Path("/var/mobile")
@@ -315,27 +315,6 @@ class Worker(StoresTest):
         os.kill(self.daemon.pid, signal.SIGKILL)
         self.daemon.wait()
         eventually(lambda: not os.path.exists(f"/proc/{worker}"), what="the worker's end")
-
-    def restart_helper(self):
-        self.daemon.stop()
-        self.daemon = Daemon()
-        self.caller = self.client()
-
-    def test_where_there_is_a_store_it_starts_after_the_helpers_first_request_whatever_that_is(self):
-        self.set_token()
-        self.restart_helper()
-        self.assertEqual(self.workers(), [], "a client that has only checked in may never ask")
-        self.caller.integer("IsVoicemailServiceSubscribed")
-        eventually(self.workers, what="the worker")
-        worker, = self.workers()
-        self.assertEqual(self.token(), "token")
-        self.assertEqual(self.workers(), [worker])
-
-    def test_where_there_is_none_it_is_not_started_ahead(self):
-        self.restart_helper()
-        for _ in range(3):
-            self.caller.integer("IsVoicemailServiceSubscribed")
-        self.assertEqual(self.workers(), [])
 
     def test_it_has_the_accounts_rights_and_no_others(self):
         self.set_token()
