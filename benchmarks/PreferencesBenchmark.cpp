@@ -34,9 +34,9 @@
 //
 // Then a voicemail token read from the store worker, beside a bare ping-pong with another process: 288 bytes
 // there, 36 back, no more. And two first reads beside the start of a worker that is asked for nothing: from a
-// worker that was started ahead, as the helper does it where there is a store, and one that starts the worker
-// itself, as the helper does it when its very first request is for the store. Run by root, this needs an
-// account "mobile": the tests' sandbox has one.
+// worker that was started ahead, as the helper does it for a phone that is subscribed to visual voicemail,
+// and one that starts the worker itself. Run by root, this needs an account "mobile": the tests' sandbox has
+// one.
 namespace brenvik {
 namespace {
 

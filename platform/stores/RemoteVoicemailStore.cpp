@@ -109,11 +109,14 @@ RemoteVoicemailStore::Received RemoteVoicemailStore::ask(VoicemailRequest* reque
   return received == WorkerResult::closed ? Received::workerDied : Received::nothing;
 }
 
-bool RemoteVoicemailStore::isThere() noexcept {
+void RemoteVoicemailStore::expectUse() noexcept {
+  if (std::exchange(isExpected_, true)) return;
   StoreFolder::Opened folder;
   struct stat info {};
-  return folder_.open(StoreFolder::IfMissing::fail, &folder) == StoreFolder::State::open &&
-         ::fstatat(folder.descriptor.get(), stores::kVoicemailFile, &info, AT_SYMLINK_NOFOLLOW) == 0;
+  if (folder_.open(StoreFolder::IfMissing::fail, &folder) == StoreFolder::State::open &&
+      ::fstatat(folder.descriptor.get(), stores::kVoicemailFile, &info, AT_SYMLINK_NOFOLLOW) == 0) {
+    worker_.start();
+  }
 }
 
 std::optional<std::string> RemoteVoicemailStore::perform(Operation operation, const std::string* key,

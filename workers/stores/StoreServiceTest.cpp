@@ -125,14 +125,19 @@ TEST_F(StoreServiceTest, ReadingAStoreThatIsNotThereAsksNobody) {
   EXPECT_TRUE(log.entries().empty());
 }
 
-TEST_F(StoreServiceTest, WhetherThereIsAStoreIsKnownWithoutTheWorker) {
-  EXPECT_FALSE(store.isThere());
+TEST_F(StoreServiceTest, TheWorkerIsStartedAheadOnceAndOnlyIfThereIsAStore) {
+  RemoteVoicemailStore(worker, voicemailFolder).expectUse();
   home.directory("Library/Voicemail");
-  EXPECT_FALSE(store.isThere()) << "a folder is no store";
+  RemoteVoicemailStore(worker, voicemailFolder).expectUse();
+  EXPECT_EQ(worker.started(), 0) << "a folder is no store";
   store.setToken(&token);
   const int opened = worker.opened();
-  EXPECT_TRUE(store.isThere());
-  EXPECT_EQ(worker.opened(), opened);
+  RemoteVoicemailStore another(worker, voicemailFolder);
+  another.expectUse();
+  another.expectUse();
+  EXPECT_EQ(worker.started(), 1);
+  EXPECT_EQ(worker.opened(), opened) << "nothing is asked";
+  EXPECT_EQ(another.copyToken(), token);
 }
 
 TEST_F(StoreServiceTest, AFolderThatWasReplacedIsTheOneThatCounts) {
