@@ -33,14 +33,18 @@
 // nothing.
 //
 // Then a voicemail token read from the store worker, beside a bare ping-pong with another process: 288 bytes
-// there, 36 back, no more. And the first read, which starts the worker, beside the start of a worker that is
-// asked for nothing. Run by root, this needs an account "mobile": the tests' sandbox has one.
+// there, 36 back, no more. And two first reads beside the start of a worker that is asked for nothing: from a
+// worker that was started ahead, as the helper does it for a phone that is subscribed to visual voicemail,
+// and one that starts the worker itself. Run by root, this needs an account "mobile": the tests' sandbox has
+// one.
 namespace brenvik {
 namespace {
 
 using Clock = std::chrono::steady_clock;
 
-constexpr double kMaxRatioToBare = 1.25;  // times the bare write
+constexpr double kMaxRatioToBare = 1.25;           // times the bare write
+constexpr double kMaxRatioOfFirstRead = 0.5;       // times the start of the worker
+constexpr double kMaxRatioOfColdFirstRead = 1.25;  // the same
 constexpr const char kDomain[] = "com.example.benchmark";
 
 struct SetTimes {
@@ -172,6 +176,15 @@ PreparedFolder::Account accountFor(const std::string& home) {
           mobile != nullptr ? mobile->pw_gid : ::getegid()};
 }
 
+void waitUntilItRuns(WorkerProgram& worker) {
+  // It knows no such work, so it hangs up as soon as it runs.
+  WorkerChannel channel;
+  WorkerMessage message;
+  require(worker.open(0, &channel) == WorkerResult::done, "open");
+  require(channel.receive(&message, Clock::now() + std::chrono::seconds(10)) == WorkerResult::closed,
+          "start");
+}
+
 bool compareTokenReads() {
   const Folder home;
   // Looked up once, as the helper does it.
@@ -194,28 +207,30 @@ bool compareTokenReads() {
                                     {{"token read", [&] { return microsecondsOf([&] { read(store); }); }},
                                      {"bare ping-pong", [&] { return bare.pingPong(); }}},
                                     {{.ours = 0, .peer = 1, .most = 10.0}});
-  const bool startsAtOnce =
-      comparePaired({.rounds = 15, .unmeasured = 0, .measured = 4},
-                    {{"first token read",
-                      [&] {
-                        WorkerProgram fresh(description);
-                        RemoteVoicemailStore first(fresh, folder);
-                        return microsecondsOf([&] { read(first); });
-                      }},
-                     {"start of the worker",
-                      [&] {
-                        WorkerProgram fresh(description);
-                        return microsecondsOf([&] {
-                          // It knows no such work, so it hangs up as soon as it runs.
-                          WorkerChannel channel;
-                          WorkerMessage message;
-                          require(fresh.open(0, &channel) == WorkerResult::done, "open");
-                          require(channel.receive(&message, Clock::now() + std::chrono::seconds(10)) ==
-                                      WorkerResult::closed,
-                                  "start");
-                        });
-                      }}},
-                    {{.ours = 0, .peer = 1, .most = 1.25}});
+  const auto firstRead = [&](WorkerProgram& fresh) {
+    RemoteVoicemailStore first(fresh, folder);
+    return microsecondsOf([&] { read(first); });
+  };
+  const bool startsAtOnce = comparePaired({.rounds = 15, .unmeasured = 0, .measured = 4},
+                                          {{"first token read, worker started ahead",
+                                            [&] {
+                                              WorkerProgram fresh(description);
+                                              fresh.start();
+                                              waitUntilItRuns(fresh);
+                                              return firstRead(fresh);
+                                            }},
+                                           {"first token read, which starts the worker",
+                                            [&] {
+                                              WorkerProgram fresh(description);
+                                              return firstRead(fresh);
+                                            }},
+                                           {"start of the worker",
+                                            [&] {
+                                              WorkerProgram fresh(description);
+                                              return microsecondsOf([&] { waitUntilItRuns(fresh); });
+                                            }}},
+                                          {{.ours = 0, .peer = 2, .most = kMaxRatioOfFirstRead},
+                                           {.ours = 1, .peer = 2, .most = kMaxRatioOfColdFirstRead}});
   return isFast && startsAtOnce;
 }
 

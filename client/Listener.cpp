@@ -77,8 +77,11 @@ bool ServiceSocket::adopt(int descriptor) noexcept {
   return true;
 }
 
-ServiceSocket::~ServiceSocket() {
+ServiceSocket::~ServiceSocket() { (void)release(); }
+
+UniqueFd ServiceSocket::release() noexcept {
   if (socket_.isValid() && isNamed()) ::unlink(address_.sun_path);
+  return std::move(socket_);
 }
 
 bool ServiceSocket::isNamed() const noexcept {
@@ -118,6 +121,12 @@ std::int32_t ServiceSocket::listenAt(const char* directory, const char* name) no
   device_ = facts.st_dev;
   inode_ = facts.st_ino;
   return BVMH_OK;
+}
+
+Listener::~Listener() {
+  for (ServiceSocket& each : services_) {
+    if (UniqueFd socket = each.release(); socket.isValid()) turnedAway_.closeListening(std::move(socket));
+  }
 }
 
 std::int32_t Listener::systemFailure() noexcept {

@@ -29,6 +29,8 @@ class ServiceSocket {
   bool adopt(int descriptor) noexcept;
   // Gives up an adopted descriptor; its previous owner owns it again.
   void giveBack() noexcept { (void)socket_.release(); }
+  // Removes the file as the destructor does, and hands over the socket; invalid if there is none.
+  UniqueFd release() noexcept;
   int get() const noexcept { return socket_.get(); }
   // The file that it made; empty when it made none.
   const char* path() const noexcept { return address_.sun_path; }
@@ -45,6 +47,11 @@ class ServiceSocket {
 // The telephony daemon's two services, read from one place. One thread at a time.
 class Listener {
  public:
+  Listener() = default;
+  Listener(const Listener&) = delete;
+  Listener& operator=(const Listener&) = delete;
+  // Does not wait for what strangers have sent over connections that were not accepted.
+  ~Listener();
   std::int32_t open(const char* directory, unsigned services) noexcept;
   // Takes descriptors of listening sockets, -1 for none. The listener owns them only if this returns BVMH_OK.
   std::int32_t open(int pushes, int notifications) noexcept;

@@ -106,7 +106,6 @@ class ListenerTest : public testing::Test {
   ListenerPointer listener_;
   bvmh_event event_{};
 
- private:
   std::size_t before_ = 0;
 };
 
@@ -581,6 +580,33 @@ UniqueFd lingeringSocket(UniqueFd* listening) {
   while (::send(made.get(), bytes.data(), bytes.size(), MSG_DONTWAIT | MSG_NOSIGNAL) > 0) {
   }
   return made;
+}
+
+TEST_F(ListenerTest, WhatAStrangerSentBeforeItWasAcceptedDoesNotHoldUpTheEnd) {
+  for (const bool isHandedOver : {false, true}) {
+    if (isHandedOver) {
+      bvmh_listener* made = nullptr;
+      ASSERT_EQ(bvmh_listener_create_from_fds(listeningAt(directory_.path() + kPushes).release(), -1, &made),
+                BVMH_OK);
+      listener_.reset(made);
+    } else {
+      listen();
+    }
+    UniqueFd listening;
+    UniqueFd lingering = lingeringSocket(&listening);
+    UniqueFd reader(::accept4(listening.get(), nullptr, nullptr, SOCK_CLOEXEC));
+    UniqueFd socket = connect(kPushes);
+    Script wire;
+    wire.send(socket, Bytes(24), {lingering.get()});
+    lingering.reset();
+    socket.reset();  // what it has sent is the listening socket's alone
+    const auto began = std::chrono::steady_clock::now();
+    listener_.reset();
+    EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(10)) << "and not an hour";
+    reader.reset();  // a reset: nothing is left to wait for
+    listening.reset();
+    while (openDescriptors() > before_) std::this_thread::yield();
+  }
 }
 
 TEST_F(ListenerTest, WhatAStrangerSendsAlongHoldsUpNobody) {

@@ -2,11 +2,13 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "client/TurnedAway.h"
 
+#include <poll.h>
 #include <pthread.h>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <atomic>
 #include <cerrno>
@@ -22,19 +24,19 @@ namespace {
 
 constexpr std::size_t kStackBytes = 256 * 1024;
 
-// One connection, and what the thread that closes it needs.
+// One descriptor, and what the thread that closes it needs.
 struct Slot {
   // `kept`: its thread could not be started; the next close() tries again.
   enum class Use : std::uint8_t { free, kept, closing };
   std::atomic<Use> use{Use::free};
-  UniqueFd connection;
+  UniqueFd descriptor;
   std::shared_ptr<void> owner;
   int told = -1;  // the owner's event
 };
 
 void* closeSlot(void* given) noexcept {
   auto& slot = *static_cast<Slot*>(given);
-  slot.connection.reset();
+  slot.descriptor.reset();
   const std::shared_ptr<void> owner = std::move(slot.owner);  // the slot goes with it
   slot.use = Slot::Use::free;
   const std::uint64_t one = 1;
@@ -67,7 +69,7 @@ void startThread(Slot& slot, const std::shared_ptr<void>& owner) noexcept {
 
 struct TurnedAway::State {
   UniqueFd event;
-  std::array<Slot, kMaxThreads> slots;
+  std::array<Slot, kMaxThreads + kMaxListening> slots;
 };
 
 bool TurnedAway::prepare() noexcept {
@@ -86,19 +88,27 @@ bool TurnedAway::prepare() noexcept {
 }
 
 bool TurnedAway::hasRoom() const noexcept {
-  for (const Slot& slot : state_->slots) {
-    if (slot.use == Slot::Use::free) return true;
-  }
-  return false;
+  const auto free = std::count_if(state_->slots.begin(), state_->slots.end(),
+                                  [](const Slot& slot) { return slot.use == Slot::Use::free; });
+  return static_cast<std::size_t>(free) > kMaxListening;
 }
 
 void TurnedAway::close(UniqueFd connection) noexcept {
   // Nothing is put into it once it is shut, and most are empty then.
   (void)::shutdown(connection.get(), SHUT_RDWR);
-  if (isDrained(connection.get())) return;
+  if (!isDrained(connection.get())) closeOnThread(std::move(connection));
+}
+
+void TurnedAway::closeListening(UniqueFd listening) noexcept {
+  // Others may hold the same socket, so it is not shut, and none of its connections is accepted.
+  pollfd waiting{listening.get(), POLLIN, 0};
+  if (::poll(&waiting, 1, 0) != 0) closeOnThread(std::move(listening));
+}
+
+void TurnedAway::closeOnThread(UniqueFd descriptor) noexcept {
   for (Slot& slot : state_->slots) {
-    if (slot.use == Slot::Use::free && connection.isValid()) {
-      slot.connection = std::move(connection);
+    if (slot.use == Slot::Use::free && descriptor.isValid()) {
+      slot.descriptor = std::move(descriptor);
       slot.use = Slot::Use::kept;
     }
     if (slot.use == Slot::Use::kept) startThread(slot, state_);

@@ -16,6 +16,7 @@ namespace brenvik::client {
 class TurnedAway {
  public:
   static constexpr std::size_t kMaxThreads = 16;
+  static constexpr std::size_t kMaxListening = 2;
 
   // False with errno set when memory or descriptors are lacking.
   bool prepare() noexcept;
@@ -23,11 +24,17 @@ class TurnedAway {
   bool hasRoom() const noexcept;
   // Closes the connection, here or elsewhere. Precondition: hasRoom().
   void close(UniqueFd connection) noexcept;
+  // Closes a listening socket, and with it the connections that nobody has accepted and what was sent over
+  // them; if there are any, on a thread. Has room for kMaxListening sockets, whatever hasRoom() says.
+  // Precondition: prepare().
+  void closeListening(UniqueFd listening) noexcept;
   // Readable when there may be room again; wasTold() ends that. -1 before prepare().
   int readable() const noexcept;
   void wasTold() const noexcept;
 
  private:
+  void closeOnThread(UniqueFd descriptor) noexcept;
+
   struct State;
   std::shared_ptr<State> state_;  // a thread that waits outlives the listener
 };

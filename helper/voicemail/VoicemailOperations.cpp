@@ -85,6 +85,7 @@ KernelReturn VoicemailOperations::isVoicemailServiceSubscribed(PortName, std::ui
   return guarded(kern::failure, [&] {
     std::call_once(lookedUp_, [this] { query_ = library_.lookUpSubscriptionQuery(); });
     *subscribed = query_ != nullptr && query_() ? 1 : 0;
+    if (*subscribed != 0) store_.expectUse();
     return kern::success;
   });
 }

@@ -155,6 +155,19 @@ TEST_F(VoicemailOperationsTest, WithoutVisualVoicemailTheAnswerIs0OnEveryCallAnd
     EXPECT_EQ(subscribed, 0);
   }
   EXPECT_EQ(library.lookUps, 1);
+  EXPECT_EQ(store.expected, 0);
+}
+
+TEST_F(VoicemailOperationsTest, WhoIsSubscribedIsExpectedToUseTheStore) {
+  static bool answer;
+  library.query = [] { return answer; };
+  for (const bool subscribed : {false, true}) {
+    answer = subscribed;
+    std::uint8_t told = 7;
+    EXPECT_EQ(operations.isVoicemailServiceSubscribed(kPort, &told), 0);
+    EXPECT_EQ(store.expected, subscribed ? 1 : 0);
+  }
+  EXPECT_TRUE(store.calls.empty());
 }
 
 TEST_F(VoicemailOperationsTest, TheQuerysAnswerIsStoredOnEveryCallAndItIsLookedUpOnce) {

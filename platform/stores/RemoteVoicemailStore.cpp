@@ -3,6 +3,7 @@
 #include "platform/stores/RemoteVoicemailStore.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 
 #include <new>
 #include <utility>
@@ -106,6 +107,16 @@ RemoteVoicemailStore::Received RemoteVoicemailStore::ask(VoicemailRequest* reque
   // Nobody would know what an answer that comes later answers.
   worker_.giveUp(&channel_);
   return received == WorkerResult::closed ? Received::workerDied : Received::nothing;
+}
+
+void RemoteVoicemailStore::expectUse() noexcept {
+  if (std::exchange(isExpected_, true)) return;
+  StoreFolder::Opened folder;
+  struct stat info {};
+  if (folder_.open(StoreFolder::IfMissing::fail, &folder) == StoreFolder::State::open &&
+      ::fstatat(folder.descriptor.get(), stores::kVoicemailFile, &info, AT_SYMLINK_NOFOLLOW) == 0) {
+    worker_.start();
+  }
 }
 
 std::optional<std::string> RemoteVoicemailStore::perform(Operation operation, const std::string* key,

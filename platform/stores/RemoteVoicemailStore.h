@@ -27,6 +27,8 @@ class RemoteVoicemailStore final : public VoicemailStore {
   RemoteVoicemailStore(Worker& worker, StoreFolder& folder, std::chrono::milliseconds patience = kPatience)
       : worker_(worker), folder_(folder), patience_(patience) {}
 
+  // If there is a store, whatever it holds, starts the worker.
+  void expectUse() noexcept override;
   void setToken(const std::string* token) override;
   void setTokenForKey(const std::string& key, const std::string& token) override;
   void removeAllRecords() override;
@@ -49,6 +51,7 @@ class RemoteVoicemailStore final : public VoicemailStore {
   const std::chrono::milliseconds patience_;
   WorkerChannel channel_;
   std::uint32_t serial_ = 0;
+  bool isExpected_ = false;
   StoreFolder::Opened told_;  // the folder that the worker works in
 };
 

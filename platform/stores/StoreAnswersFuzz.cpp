@@ -38,6 +38,7 @@ class Answered final : public Worker {
     kept_ = std::move(theirs);  // or the requests could not be sent
     return WorkerResult::done;
   }
+  void start() noexcept override {}
   void giveUp(WorkerChannel* channel) noexcept override { channel->close(); }
 
  private:

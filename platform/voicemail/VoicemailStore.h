@@ -17,6 +17,10 @@ class VoicemailStore {
  public:
   virtual ~VoicemailStore() = default;
 
+  // The store will probably be used soon: makes ready what its first use would wait for. Waits for nothing,
+  // fails silently, and changes nothing in the store. Calls after the first one do nothing.
+  virtual void expectUse() noexcept = 0;
+
   // Null clears the general token.
   virtual void setToken(const std::string* token) = 0;
   virtual void setTokenForKey(const std::string& key, const std::string& token) = 0;

@@ -19,6 +19,11 @@ class Worker {
   // stays silent. Closing the channel cancels the work; if the worker dies, all of its channels hang up.
   virtual WorkerResult open(std::uint32_t work, WorkerChannel* channel) noexcept = 0;
 
+  // Connects to the worker or starts it, so that the next open() finds it at work. Does nothing if it is
+  // there already. Like open(), it never waits. It logs nothing: a worker that cannot be reached is an error
+  // of the open() that needs it.
+  virtual void start() noexcept = 0;
+
   // Closes the channel and ends its worker, because it missed its deadline, sent malformed data or hung up
   // too early. All channels of that worker hang up, and the next open() uses a new worker. If that worker has
   // already gone, it only closes the channel.

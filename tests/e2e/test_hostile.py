@@ -175,6 +175,25 @@ class HostileClients(HelperTest):
         self.good.close()
         self.assertEqual(self.daemon.wait(), 0, "nobody holds the process")
 
+    def test_a_client_that_the_helper_itself_would_keep_alive_is_not_let_in(self):
+        self.assert_served()
+        before = self.settled_descriptors()
+        message = wire.check_in_message()
+        failure = 5
+        service, another = wire.connect(), wire.connect()
+        one, other = socket.socketpair(socket.AF_UNIX, socket.SOCK_SEQPACKET)
+        self.assertEqual(service.status(message, [service.fileno()]), failure, "the other end is the helper's")
+        self.assertEqual(service.status(message, [another.fileno()]), failure)
+        reply, fds = service.exchange(message, [one.fileno()])
+        self.assertEqual((len(reply), len(fds)), (40, 1))
+        self.assertEqual(service.status(message, [other.fileno()]), failure, "the other end is watched")
+        os.close(fds[0])
+        for each in (service, another, one, other):
+            each.close()
+        eventually(lambda: self.daemon.descriptors() <= before, what="the descriptors going back")
+        self.good.close()
+        self.assertEqual(self.daemon.wait(), 0, "nobody holds the process")
+
     def settled_descriptors(self):
         """How many it has when it has done all that was asked of it."""
         seen = []

@@ -64,7 +64,8 @@ std::vector<Description> descriptions() {
        {COUNT(CheckInRequest, 1),
         ARGUMENT(CheckInRequest, clientPort, "the caller's port", "port", "port descriptor")},
        "Makes a client of the caller; the reply carries its channel.",
-       "5 the caller's port has died already; 6 out of descriptors; 35 not entitled"},
+       "5 the caller's port has died already, or its other end is the helper's; 6 out of descriptors; 35 not "
+       "entitled"},
       {"SetVoicemailToken",
        sizeof(String256Request),
        {TEXT(String256Request, text, "token")},

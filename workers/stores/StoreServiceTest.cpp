@@ -125,6 +125,21 @@ TEST_F(StoreServiceTest, ReadingAStoreThatIsNotThereAsksNobody) {
   EXPECT_TRUE(log.entries().empty());
 }
 
+TEST_F(StoreServiceTest, TheWorkerIsStartedAheadOnceAndOnlyIfThereIsAStore) {
+  RemoteVoicemailStore(worker, voicemailFolder).expectUse();
+  home.directory("Library/Voicemail");
+  RemoteVoicemailStore(worker, voicemailFolder).expectUse();
+  EXPECT_EQ(worker.started(), 0) << "a folder is no store";
+  store.setToken(&token);
+  const int opened = worker.opened();
+  RemoteVoicemailStore another(worker, voicemailFolder);
+  another.expectUse();
+  another.expectUse();
+  EXPECT_EQ(worker.started(), 1);
+  EXPECT_EQ(worker.opened(), opened) << "nothing is asked";
+  EXPECT_EQ(another.copyToken(), token);
+}
+
 TEST_F(StoreServiceTest, AFolderThatWasReplacedIsTheOneThatCounts) {
   store.setToken(&token);
   std::filesystem::rename(home / "Library/Voicemail", home / "moved");

@@ -459,7 +459,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
  public:
   ServiceSource(PortName port, const RoutineTable& table, WantTrailer trailer, SystemPortSpace& ports,
                 SystemRegions& regions, IncomingMessage& incoming, SystemPortSpace::SharedFd listening,
-                SystemPortSources::Refusals limits) noexcept
+                std::unique_ptr<HeldAddresses::Entry> address, SystemPortSources::Refusals limits) noexcept
       : port_(port),
         table_(table),
         trailer_(trailer),
@@ -467,6 +467,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
         regions_(regions),
         incoming_(incoming),
         listening_(std::move(listening)),
+        address_(std::move(address)),
         limits_(limits) {}
   ~ServiceSource() override { invalidate(); }
 
@@ -688,6 +689,7 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
   SystemRegions& regions_;
   IncomingMessage& incoming_;
   const SystemPortSpace::SharedFd listening_;
+  const std::unique_ptr<HeldAddresses::Entry> address_;  // of the service's ends of all connections
   std::array<UniqueFd, kReservedDescriptors> reserve_;
   RunLoop* loop_ = nullptr;
   std::unique_ptr<DescriptorSource> source_;
@@ -708,8 +710,9 @@ class ServiceSource final : public RoutineSource, private ChannelOwner {
 // Keeps its own hold on the send right: the name may be freed while the watch still waits for the hang-up.
 class SocketDeathWatch final : public DeathWatch {
  public:
-  SocketDeathWatch(PortName port, SystemPortSpace::SharedFd end) noexcept
-      : port_(port), end_(std::move(end)) {}
+  SocketDeathWatch(PortName port, SystemPortSpace::SharedFd end,
+                   std::unique_ptr<HeldAddresses::Entry> address) noexcept
+      : port_(port), end_(std::move(end)), address_(std::move(address)) {}
 
   bool addTo(RunLoop& loop) {
     source_ = loop.addDescriptor(end_->get(), Interest::none, [this](Readiness readiness) {
@@ -735,6 +738,7 @@ class SocketDeathWatch final : public DeathWatch {
   }
   const PortName port_;
   const SystemPortSpace::SharedFd end_;
+  const std::unique_ptr<HeldAddresses::Entry> address_;
   std::function<void(DeathWatch&)> callback_;
   std::unique_ptr<DescriptorSource> source_;
 };
@@ -752,8 +756,9 @@ std::shared_ptr<RoutineSource> SystemPortSources::makeRoutineSource(PortName por
   if (end == nullptr) return nullptr;
   try {
     if (ports_.isService(port)) {
+      auto address = held_->add(end->get());
       return std::make_shared<ServiceSource>(port, table, trailer, ports_, regions_, incoming_,
-                                             std::move(end), refusals_);
+                                             std::move(end), std::move(address), refusals_);
     }
     auto source = std::make_shared<PortSource>(port, table, trailer);
     source->setChannel(ports_, regions_, incoming_, std::move(end));
@@ -767,7 +772,9 @@ std::shared_ptr<DeathWatch> SystemPortSources::makeDeathWatch(PortName port, Run
   auto end = ports_.sendEnd(port);
   if (end == nullptr) return nullptr;
   try {
-    auto watch = std::make_shared<SocketDeathWatch>(port, std::move(end));
+    if (held_->hasOtherEndOf(end->get())) return nullptr;
+    auto address = held_->add(end->get());
+    auto watch = std::make_shared<SocketDeathWatch>(port, std::move(end), std::move(address));
     if (!watch->addTo(loop)) return nullptr;
     return watch;
   } catch (const std::bad_alloc&) {

@@ -5,6 +5,7 @@
 #include <memory>
 
 #include "platform/ipc/Ports.h"
+#include "platform/ipc/linux/HeldAddresses.h"
 #include "platform/ipc/linux/IncomingMessage.h"
 #include "platform/ipc/linux/SystemPortSpace.h"
 #include "platform/ipc/linux/SystemRegions.h"
@@ -29,12 +30,15 @@ class SystemPortSources final : public PortSources {
 
   std::shared_ptr<RoutineSource> makeRoutineSource(PortName port, const RoutineTable& table,
                                                    WantTrailer trailer) noexcept override;
+  // Also returns null if the port's other end is held by this process itself: the service's end of a
+  // connection, or a socket of another watch. Such a port would not die before this process.
   std::shared_ptr<DeathWatch> makeDeathWatch(PortName port, RunLoop& loop) noexcept override;
 
  private:
   SystemPortSpace& ports_;
   SystemRegions& regions_;
   const Refusals refusals_;
+  const std::shared_ptr<HeldAddresses> held_ = std::make_shared<HeldAddresses>();
   // The process serves one message at a time, so all channels share one buffer.
   IncomingMessage incoming_;
 };

@@ -879,6 +879,26 @@ TEST_F(PortsTest, ARightThatIsGivenUpStaysOpenForOthersWhoHoldTheSameSocket) {
   EXPECT_EQ(::recv(theirs.get(), &letter, 1, MSG_DONTWAIT), 1);
 }
 
+TEST_F(PortsTest, TwoEndsOfOnePairAreNotBothWatchedWhoeverNamedThem) {
+  for (const bool isNamedBefore : {false, true}) {
+    auto [one, other] = pair();
+    const sockaddr_un own{AF_UNIX, "\0brenvik-test-held-end"};
+    if (isNamedBefore) {
+      ASSERT_EQ(::bind(one.get(), reinterpret_cast<const sockaddr*>(&own), sizeof own), 0);
+    }
+    const UniqueFd again(::fcntl(one.get(), F_DUPFD_CLOEXEC, 0));
+    const PortName first = ports.adoptSendRight(std::move(one));
+    const PortName second = ports.adoptSendRight(std::move(other));
+    auto watch = sources.makeDeathWatch(first, *loop);
+    ASSERT_NE(watch, nullptr);
+    EXPECT_EQ(sources.makeDeathWatch(second, *loop), nullptr) << "each would keep the other alive";
+    const PortName same = ports.adoptSendRight(UniqueFd(::fcntl(again.get(), F_DUPFD_CLOEXEC, 0)));
+    EXPECT_NE(sources.makeDeathWatch(same, *loop), nullptr) << "the same end twice does no harm";
+    watch.reset();
+    EXPECT_NE(sources.makeDeathWatch(second, *loop), nullptr) << "nothing of a watch that is gone is left";
+  }
+}
+
 TEST_F(PortsTest, AnInvalidatedWatchTellsNothing) {
   auto [theirs, ours] = pair();
   const auto watch = sources.makeDeathWatch(ports.adoptSendRight(std::move(ours)), *loop);

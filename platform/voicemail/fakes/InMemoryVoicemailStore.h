@@ -19,7 +19,9 @@ class InMemoryVoicemailStore final : public VoicemailStore {
 
   bool exhausted = false;  // there is no memory
   int failures = 0;        // for so many operations there will be none
+  int expected = 0;        // how often expectUse() was called
 
+  void expectUse() noexcept override { ++expected; }
   void setToken(const std::string* token) override {
     begin(token == nullptr ? "clearToken" : "setToken");
     token_ = token == nullptr ? std::nullopt : std::optional(*token);

@@ -34,6 +34,7 @@ class SqliteVoicemailStore final : public VoicemailStore {
   explicit SqliteVoicemailStore(Folder folder, SqliteTime time = SqliteTime::ofTheSystem());
   ~SqliteVoicemailStore() override;
 
+  void expectUse() noexcept override {}
   void setToken(const std::string* token) override;
   void setTokenForKey(const std::string& key, const std::string& token) override;
   void removeAllRecords() override;

@@ -53,6 +53,7 @@ class StoreAtHome final : public VoicemailStore {
               return state == StoreFolder::State::open ? opened_.descriptor.get() : -1;
             },
             time) {}
+  void expectUse() noexcept override {}
   void setToken(const std::string* token) override { store_.setToken(token); }
   void setTokenForKey(const std::string& key, const std::string& token) override {
     store_.setTokenForKey(key, token);

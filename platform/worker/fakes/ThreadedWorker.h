@@ -46,6 +46,11 @@ class ThreadedWorker final : public Worker {
     return WorkerResult::done;
   }
 
+  void start() noexcept override {
+    const std::lock_guard lock(mutex_);
+    ++started_;
+  }
+
   void giveUp(WorkerChannel* channel) noexcept override {
     const bool isOurs = channel->isOpen() && channel->generation() == generation();
     channel->close();
@@ -71,6 +76,11 @@ class ThreadedWorker final : public Worker {
     const std::lock_guard lock(mutex_);
     return opened_;
   }
+  // How often start() was called.
+  int started() const noexcept {
+    const std::lock_guard lock(mutex_);
+    return started_;
+  }
   int givenUp() const noexcept {
     const std::lock_guard lock(mutex_);
     return givenUp_;
@@ -87,6 +97,7 @@ class ThreadedWorker final : public Worker {
   WorkerResult answer_ = WorkerResult::done;
   std::uint64_t generation_ = 1;
   int opened_ = 0;
+  int started_ = 0;
   int givenUp_ = 0;
   std::vector<UniqueFd> sockets_;  // copies of the workers' ends
   std::vector<std::thread> threads_;

@@ -61,6 +61,7 @@ WorkerProgram::WorkerProgram(Description description, std::function<Clock::time_
 WorkerProgram::~WorkerProgram() { endWorker(kToLeave); }
 
 bool WorkerProgram::mayLog() noexcept {
+  if (isSilent_) return false;
   const auto now = now_();
   if (linesPaidUntil_ > now + (kLinesInARow - 1) * kOneMoreLineEvery) return false;
   linesPaidUntil_ = std::max(linesPaidUntil_, now) + kOneMoreLineEvery;
@@ -104,6 +105,18 @@ WorkerResult WorkerProgram::open(std::uint32_t work, WorkerChannel* channel) noe
   } catch (const std::bad_alloc&) {
     return WorkerResult::outOfMemory;
   }
+}
+
+void WorkerProgram::start() noexcept {
+  if (!WorkerChannel::hasRoomToDistrust()) return;
+  const std::lock_guard lock(mutex_);
+  if (connection_.isOpen()) return;
+  isSilent_ = true;
+  try {
+    (void)reach();
+  } catch (const std::bad_alloc&) {  // open() tells
+  }
+  isSilent_ = false;
 }
 
 bool WorkerProgram::isRunning() const noexcept {
@@ -191,7 +204,7 @@ WorkerResult WorkerProgram::startChild() {
   if (dying_.size() < kMaxDying) {
     for (const std::string& folder :
          description_.folders.empty() ? workerProgramFolders() : description_.folders) {
-      error = start(folder + "/" + description_.program, theirs.descriptor());
+      error = startProgram(folder + "/" + description_.program, theirs.descriptor());
       if (error == 0) {
         connection_ = std::move(ours);
         return WorkerResult::done;
@@ -208,7 +221,7 @@ WorkerResult WorkerProgram::startChild() {
 // With its end of the connection as standard input, and no other descriptor of this process than standard
 // error. That may be a terminal, so the worker has a session of its own: whoever has a terminal as its
 // session's can type into it. Nor has it this process's folder, to which it could not walk by itself.
-int WorkerProgram::start(const std::string& path, int theirs) {
+int WorkerProgram::startProgram(const std::string& path, int theirs) {
   Spawn spawn;
   spawn.give(theirs, STDIN_FILENO);
   spawn.giveNothing(STDOUT_FILENO);

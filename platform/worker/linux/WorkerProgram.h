@@ -44,6 +44,7 @@ class WorkerProgram final : public Worker {
   ~WorkerProgram() override;
 
   WorkerResult open(std::uint32_t work, WorkerChannel* channel) noexcept override;
+  void start() noexcept override;
   void giveUp(WorkerChannel* channel) noexcept override;
 
   // Whether a worker is connected or being connected. Starts none, and does not wait.
@@ -58,7 +59,7 @@ class WorkerProgram final : public Worker {
   WorkerResult reach();
   WorkerResult connectToService();
   WorkerResult startChild();
-  int start(const std::string& path, int theirs);
+  int startProgram(const std::string& path, int theirs);
   void endWorker(std::chrono::milliseconds mayTake) noexcept;
   static bool isReaped(const Child& child, std::chrono::milliseconds patience) noexcept;
   bool mayLog() noexcept;
@@ -71,6 +72,7 @@ class WorkerProgram final : public Worker {
   Child child_;
   std::vector<Child> dying_;  // killed, but not yet dead
   Clock::time_point linesPaidUntil_{};
+  bool isSilent_ = false;  // within start()
 };
 
 // The folder of the running program, then the one where workers are installed.

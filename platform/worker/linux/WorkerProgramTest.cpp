@@ -137,6 +137,39 @@ TEST_F(WorkerProgramTest, WhereNobodyListensTheProgramBesideThisOneIsStartedOnce
   EXPECT_EQ(lines(), std::vector<std::string>());
 }
 
+TEST_F(WorkerProgramTest, AWorkerThatWasStartedAheadIsTheOneThatIsOpened) {
+  WorkerProgram worker(description());
+  worker.start();
+  ASSERT_EQ(children().size(), 1U);
+  const pid_t child = children()[0];
+  worker.start();
+  EXPECT_TRUE(works(worker));
+  EXPECT_EQ(children(), std::vector<pid_t>{child});
+  die(worker);
+  worker.start();
+  EXPECT_EQ(children().size(), 1U) << "a new one for the one that died";
+}
+
+TEST_F(WorkerProgramTest, AWorkerThatDiesBeforeItsFirstUseIsReplacedAtThatUse) {
+  WorkerProgram worker(description());
+  worker.start();
+  ASSERT_EQ(children().size(), 1U);
+  ASSERT_EQ(::kill(children()[0], SIGKILL), 0);
+  siginfo_t info{};
+  ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(children()[0]), &info, WEXITED | WNOWAIT), 0);
+  EXPECT_TRUE(works(worker));
+  EXPECT_EQ(children().size(), 1U);
+}
+
+TEST_F(WorkerProgramTest, AWorkerThatCannotBeStartedAheadIsToldOnlyByTheOpenThatNeedsIt) {
+  WorkerProgram worker(description({folder.path()}));
+  worker.start();
+  EXPECT_EQ(lines(), std::vector<std::string>());
+  WorkerChannel channel;
+  EXPECT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::unavailable);
+  EXPECT_EQ(lines().size(), 1U);
+}
+
 TEST_F(WorkerProgramTest, TheWorkerLeavesWithItsOwner) {
   pid_t child = -1;
   {
