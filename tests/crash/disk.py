@@ -18,6 +18,7 @@ import stat
 import struct
 import subprocess
 import time
+import traceback
 
 BLOCK = 4096  # written whole or not at all; the block size of the file system
 LOOP_SET_FD, LOOP_SET_STATUS64, LOOP_GET_FREE = 0x4C00, 0x4C04, 0x4C82
@@ -136,6 +137,7 @@ class BlockLog:
         self.folder = pathlib.Path("/tmp/block-log")
         self.folder.mkdir(exist_ok=True)
         fuse = os.open("/dev/fuse", os.O_RDWR | os.O_CLOEXEC)
+        mount("block-log", self.folder, "fuse", MS_NOSUID | MS_NODEV, f"fd={fuse},rootmode=40000,user_id=0,group_id=0")
         self.control, theirs = multiprocessing.Pipe()
         self.pid = os.fork()
         if self.pid == 0:
@@ -144,13 +146,12 @@ class BlockLog:
                 self.control.close()
                 Server(fuse, theirs, bytearray(pathlib.Path(image).read_bytes())).serve()
                 status = 0
+            except BaseException:
+                traceback.print_exc()
             finally:
                 os._exit(status)
         theirs.close()
-        try:
-            mount("block-log", self.folder, "fuse", MS_NOSUID | MS_NODEV, f"fd={fuse},rootmode=40000,user_id=0,group_id=0")
-        finally:
-            os.close(fuse)
+        os.close(fuse)
         self.file = self.folder / "disk"
 
     def _ask(self, command):
@@ -230,7 +231,7 @@ class Server:
             return
         error, answer = 0, b""
         if kind == self.INIT:
-            answer = struct.pack("<IIIIHHIIHHI32x", 7, 31, 0, (1 << 5) | (1 << 22), 16, 12, self.MOST, 1,
+            answer = struct.pack("<IIIIHHIIHHI28x", 7, 31, 0, (1 << 5) | (1 << 22), 16, 12, self.MOST, 1,
                                  self.MOST // 4096, 0, 0)
         elif kind == self.LOOKUP:
             if bytes(body) == b"disk\0":
