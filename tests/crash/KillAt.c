@@ -1,14 +1,18 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 //
-// Kills a process at the start of one of its system calls: that call does not take place, all calls before it did.
+// Kills a process at the start of one of its system calls: that call does not take place, all calls before it
+// did.
 //
-// usage: kill-at PID NUMBER      kills at the call of that number, counted over all threads from 1; 0: only counts
-//        kill-at PID fork        kills when the process has made a child that shares its memory (vfork, posix_spawn),
+// usage: kill-at PID NUMBER      kills at the call of that number, counted over all threads from 1; 0: only
+// counts
+//        kill-at PID fork        kills when the process has made a child that shares its memory (vfork,
+//        posix_spawn),
 //                                and keeps that child from running until SIGTERM comes
 //
-// Prints "ready" when the calls count from now on, then one line: "killed NUMBER NAME", "killed fork CHILD", or
-// "counted NUMBER" when SIGTERM came first or the process ended by itself. Needs the right to trace the process.
+// Prints "ready" when the calls count from now on, then one line: "killed NUMBER NAME", "killed fork CHILD",
+// or "counted NUMBER" when SIGTERM came first or the process ended by itself. Needs the right to trace the
+// process.
 #define _GNU_SOURCE
 #include <dirent.h>
 #include <errno.h>
@@ -143,6 +147,13 @@ static bool atCall(pid_t id, int status, bool isReady) {
 
 static void holdUntilOver(pid_t process, pid_t child) {
   killAll(process);
+  // Its maker learns of the death of a traced process when we have.
+  int status = 0;
+  do {
+    const pid_t id = waitpid(-1, &status, __WALL);
+    if (id < 0) fail("waitpid");
+    if (id == process && !WIFSTOPPED(status)) break;
+  } while (true);
   char line[64];
   snprintf(line, sizeof line, "killed fork %d", child);
   say(line);

@@ -28,6 +28,12 @@ MS_NOSUID, MS_NODEV, MS_NOATIME, MS_BIND = 2, 4, 1024, 4096
 libc = ctypes.CDLL(None, use_errno=True)
 
 
+def is_available():
+    """Whether this system has what the tests need."""
+    return (os.path.exists("/dev/fuse") and "loop-control" in pathlib.Path("/proc/misc").read_text()
+            and "ext4" in pathlib.Path("/proc/filesystems").read_text())
+
+
 def mount(source, target, kind=None, flags=0, options=None):
     encoded = [None if each is None else os.fsencode(each) for each in (source, target, kind)]
     if libc.mount(*encoded, ctypes.c_ulong(flags), None if options is None else os.fsencode(options)) != 0:
@@ -269,36 +275,40 @@ def blocks(event):
         offset, data = offset + size, data[size:]
 
 
-def states(base, events, generator, subsets):
-    """What the disk may hold after a power cut at each moment: (what was cut, image, whether it is after the mark).
+class Cut:
+    """One state of the disk after a power cut."""
 
-    At each event of the log: nothing of what was not flushed, all of it, and so many random subsets of its blocks. The same
-    state is not told twice.
-    """
-    durable, pending, is_after_mark = bytearray(base), [], False
-    seen = set()
+    def __init__(self, base, written, where, is_after_mark):
+        self._base, self._written, self.where, self.is_after_mark = base, written, where, is_after_mark
 
-    def with_blocks(chosen):
-        image = bytearray(durable)
-        for offset, data in chosen:
+    def image(self):
+        image = bytearray(self._base)
+        for offset, data in self._written:
             image[offset:offset + len(data)] = data
-        return bytes(image)
+        return image
 
+
+def cuts(base, events, generator, subsets):
+    """What the disk may hold after a power cut at each event of the log: nothing of what was not flushed, all of it, and so
+    many random subsets of its blocks. Each state once, before the mark and after it."""
+    durable, pending, is_after_mark = [], [], False
+    seen, found = set(), []
     for number, event in enumerate(["start", *events]):
         if event == "flush":
-            for offset, data in pending:
-                durable[offset:offset + len(data)] = data
-            pending = []
+            durable, pending = durable + pending, []
         elif event == "mark":
             is_after_mark = True
         elif event != "start":
             pending.extend(blocks(event))
-        choices = [("nothing unflushed", []), ("all of it", pending)]
-        for each in range(subsets if pending else 0):
-            choices.append((f"subset {each}", [block for block in pending if generator.random() < 0.5]))
+        everything = range(len(pending))
+        choices = [("nothing", ()), ("all", tuple(everything))]
+        choices += [(f"subset {each}", tuple(i for i in everything if generator.random() < 0.5)) for each in range(subsets)]
         for name, chosen in choices:
-            image = with_blocks(chosen)
-            key = hash((is_after_mark, image))
+            whole = len(chosen) == len(pending)
+            key = (is_after_mark, len(durable) + len(chosen) if whole else len(durable), () if whole else chosen)
             if key not in seen:
                 seen.add(key)
-                yield f"event {number} of {len(events)}, {name} of {len(pending)} blocks", image, is_after_mark
+                found.append(Cut(base, durable + [pending[i] for i in chosen],
+                                 f"event {number} of {len(events)}, {name} of {len(pending)} blocks that were not flushed",
+                                 is_after_mark))
+    return found

@@ -6,14 +6,16 @@ After each of these the helper is started again and asked: what was to be change
 what was answered is there. Everything stands on an ext4 of the test's own, on a loop device (disk.py); stores.py says what is
 changed and what may be found.
 
-BRENVIK_CRASH_KILLS: how many kills each store is to survive (default 40), BRENVIK_CRASH_CUTS: how many states after a power
-cut (default 30), BRENVIK_CRASH_SEED: other values and sizes, BRENVIK_CRASH_FROM: the first call to kill at. `run` beside this
-file goes on for as long as is asked.
+BRENVIK_CRASH_KILLS: how many kills each store is to survive (default 20), BRENVIK_CRASH_CUTS: how many states after a power
+cut (default 10), BRENVIK_CRASH_SEED: other values, sizes and choices. Few kills are spread over all calls of a step. `run`
+beside this file goes on until each store has survived as many as are asked.
 """
 import contextlib
+import itertools
 import os
 import pathlib
 import random
+import select
 import subprocess
 import sys
 import time
@@ -29,10 +31,10 @@ import wire
 from harness import BUILD, Daemon, Logs, entitle, listen
 from test_lasd import HOST, UpdateTest
 
-KILLS = int(os.environ.get("BRENVIK_CRASH_KILLS", 40))
-CUTS = int(os.environ.get("BRENVIK_CRASH_CUTS", 30))
+KILLS = int(os.environ.get("BRENVIK_CRASH_KILLS", 20))
+CUTS = int(os.environ.get("BRENVIK_CRASH_CUTS", 10))
 SEED = int(os.environ.get("BRENVIK_CRASH_SEED", 1))
-FIRST = int(os.environ.get("BRENVIK_CRASH_FROM", 1))
+MOMENT = 0.1  # seconds, for what the process does after its reply
 SUBSETS = 2  # of what was not flushed, at each event
 KILL_AT = BUILD / "brenvik-kill-at"
 PLACES = {"mobile": "/var/mobile", "root": "/root/Library"}
@@ -50,6 +52,8 @@ class KillAt:
 
     def end(self):
         """What it says last, as words."""
+        # The reply is seen before the call that comes after it.
+        select.select([self.process.stdout], [], [], MOMENT)
         self.process.terminate()
         words = self.process.stdout.read().split()
         self.process.stdout.close()
@@ -61,6 +65,11 @@ class KillAt:
 class CrashTest(unittest.TestCase):
     """A daemon, started by the test as a service manager would, on the file system of the test."""
     loops = None
+
+    @classmethod
+    def setUpClass(cls):
+        if not disk.is_available():
+            raise unittest.SkipTest("no loop devices or no FUSE here")
 
     serve = UpdateTest.serve
     set_hosts = UpdateTest.set_hosts
@@ -133,35 +142,47 @@ class CrashTest(unittest.TestCase):
 
 class Kills(CrashTest):
     def kill_everywhere(self, name):
-        """Steps of a store, each killed one system call later than the one before, until one is not killed; then from the
-        first call again."""
+        """Steps of a store, each killed at a later system call than the one before, until a step has no more; then again from
+        the first call."""
         self.volume.mount(self.image)
         store = self.make_store(name)
-        kills, sweeps, number, longest, answers = 0, 0, FIRST, 0, 0
-        while kills < KILLS:
-            with wire.Client() as client:
-                store.ready(client)
-                killer = KillAt(store.victim(), number)
-                answered = self.take(store, client)
-                words = killer.end()
-            killed = words[0] == "killed"
-            where = f"store {name}, seed {SEED}, step {store.number}: {' '.join(words)}"
-            if killed:
-                kills += 1
-                number += 1
-                answers += answered
-                excused = store.is_excused(killed)
-                if not self.daemon_goes_on(store):
-                    self.stop()
-                    self.start()
-            else:
-                self.assertTrue(answered, where)
-                longest, number, sweeps, excused = max(longest, int(words[1])), 1, sweeps + 1, False
-            with self.subTest(where), wire.Client() as client:
-                store.check(client, answered and not excused)
-        print(f"crash {name}: {kills} kills, {answers} of them after the answer; {sweeps} sweeps to the end, of up to "
-              f"{longest} calls; the next at {number}", flush=True)
-        return kills
+        calls = self.interrupt(store, name, 0)[1]
+        self.kills, self.answered, longest = 0, 0, calls
+        choose = random.Random(f"calls {name} {SEED}")
+        while self.kills < KILLS:
+            # Sizes differ, so a step may have more calls than the last one to its end.
+            each = itertools.count(1)
+            if KILLS < longest:
+                each = sorted(choose.sample(range(1, longest + 1), KILLS - self.kills))
+            for number in each:
+                killed, calls = self.interrupt(store, name, number)
+                longest = max(longest, calls)
+                if not killed or self.kills == KILLS:
+                    break
+        print(f"crash {name}: {self.kills} kills, {self.answered} of them after the answer, in steps of up to {longest} calls",
+              flush=True)
+
+    def interrupt(self, store, name, number):
+        """One step, killed at that call, and a look at what there is. Whether it was killed, and at which call it ended."""
+        with wire.Client() as client:
+            store.ready(client)
+            killer = KillAt(store.victim(), number)
+            answered = self.take(store, client)
+            words = killer.end()
+        killed = words[0] == "killed"
+        where = f"store {name}, seed {SEED}, step {store.number}: {' '.join(words)}"
+        excused = store.is_excused(killed)
+        if killed:
+            self.kills += 1
+            self.answered += answered
+            if not self.daemon_goes_on(store):
+                self.stop()
+                self.start()
+        else:
+            self.assertTrue(answered, where)
+        with self.subTest(where), wire.Client() as client:
+            store.check(client, answered and not excused)
+        return killed, int(words[1])
 
     def daemon_goes_on(self, store):
         return isinstance(store, stores.TokensOfTheWorker)
@@ -185,15 +206,19 @@ class PowerCuts(CrashTest):
                 self.stop()
                 self.volume.unmount()
                 old = store.old if hasattr(store, "old") else None
-                states = list(disk.states(base, events, store.generator, SUBSETS))
-                store.generator.shuffle(states)
+                cuts = disk.cuts(base, events, store.generator, SUBSETS)
                 events_seen += len(events)
-                for where, image, answered in states[:CUTS - done]:
+                # Few are spread over all moments before the answer; those after it are always among them.
+                chosen = [cut for cut in cuts if not cut.is_after_mark]
+                late = [cut for cut in cuts if cut.is_after_mark]
+                if len(cuts) > CUTS - done:
+                    chosen = store.generator.sample(chosen, max(CUTS - done - len(late), 1))
+                for cut in chosen + late:
                     done += 1
-                    after += answered
+                    after += cut.is_after_mark
                     if hasattr(store, "old"):
                         store.old = old
-                    self.look_at(store, name, where, image, answered)
+                    self.look_at(store, name, cut)
                 self.volume.mount(log.file)
                 self.start()
                 if hasattr(store, "old"):
@@ -206,17 +231,52 @@ class PowerCuts(CrashTest):
             self.volume.unmount()
             log.close()
 
-    def look_at(self, store, name, where, image, answered):
+    def look_at(self, store, name, cut):
         file = pathlib.Path("/tmp/state.img")
-        file.write_bytes(image)
+        file.write_bytes(cut.image())
         self.volume.mount(file)
         self.start()
         try:
-            with self.subTest(f"store {name}, seed {SEED}, step {store.number}: {where}"), wire.Client() as client:
-                store.check(client, answered)
+            with self.subTest(f"store {name}, seed {SEED}, step {store.number}: {cut.where}"), wire.Client() as client:
+                store.check(client, cut.is_after_mark)
         finally:
             self.stop()
             self.volume.unmount()
+
+
+class KilledWhileItMakesAChild(unittest.TestCase):
+    """Until the child becomes another program, it has copies of the helper's descriptors: its sockets, too."""
+
+    def setUp(self):
+        logs = Logs()
+        self.addCleanup(logs.close)
+        entitle()
+        pathlib.Path("/tmp/empty.zip").write_bytes(b"PK\5\6" + bytes(18))
+        self.daemon = Daemon()
+        self.addCleanup(lambda: self.daemon.stop())  # the one that the test has by then
+        self.killer = KillAt(self.daemon.pid, "fork")
+        with wire.Client() as client:  # the program that reads archives is the child
+            client.channel.send(wire.simple("UnpackArchive", stores.short("/tmp/empty.zip"), stores.short("/tmp/empty")))
+            self.assertEqual(self.killer.process.stdout.read(len("killed fork")), "killed fork")
+        killed = self.daemon
+        killed.process.wait()
+        self.addCleanup(killed.stop)  # the child has its standard error
+
+    def test_the_next_one_takes_the_socket_file_over_as_soon_as_the_child_lets_go(self):
+        orphan = wire.connect()
+        self.addCleanup(orphan.close)
+        self.daemon = Daemon(wait=False)
+
+        def has_lock():
+            self.assertTrue(self.daemon.running())
+            folder = pathlib.Path(f"/proc/{self.daemon.pid}/fd")
+            return any(os.readlink(each).endswith(".lock") for each in folder.iterdir())
+        harness.eventually(has_lock, what="the lock under which it looks who listens")
+        self.killer.end()
+        with self.assertRaises(wire.Closed):
+            orphan.receive()
+        self.daemon.wait_until_listening()
+        wire.Client().close()
 
 
 def add(case, prefix, run, names):
