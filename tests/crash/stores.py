@@ -45,6 +45,8 @@ def leftovers(*folders):
 
 class Store:
     """One sort of change. `test` gives access to the daemon; `generator` chooses sizes and the like."""
+    # Nobody waits until the disk knows that a hidden item was removed.
+    removals_may_be_lost = False
 
     def __init__(self, test, generator):
         self.test, self.generator, self.number = test, generator, 0
@@ -75,9 +77,10 @@ class Store:
 
     def check_leftovers(self, answered, *folders):
         """An interrupted step leaves one in each folder at most; the next one that works there removes it."""
+        most = 0 if answered and not self.removals_may_be_lost else 1
         for folder in folders:
             left = [path.name for path in leftovers(folder)]
-            self.test.assertLessEqual(len(left), 0 if answered else 1, f"{folder}: {left}")
+            self.test.assertLessEqual(len(left), most, f"{folder}: {left}")
 
     def old_or_new(self, found, answered):
         """For stores whose state is one value: found must be self.old or self.new."""

@@ -3,7 +3,8 @@
 """A crowd of clients, each a process that calls now and then and dies at a random moment, and one that must not notice.
 
 The witness, under another account, never fails, and the optimised daemon answers 99 of 100 of its calls within 5 ms. No call
-of the crowd fails. In the end the daemon has the descriptors and the memory that it had after a first, short crowd.
+of the crowd fails. In the end the daemon has the memory that it had before there was a crowd, and the descriptors that it had
+after a first, short one.
 
 BRENVIK_LOAD_CLIENTS says how many (default 100), BRENVIK_LOAD_SECONDS how long (default 3), BRENVIK_LOAD_SEED makes a run's
 choices come again. With BRENVIK_LOAD_REALTIME the daemon and the witness come before all others of the machine, so that what is
@@ -33,7 +34,7 @@ REALTIME = "BRENVIK_LOAD_REALTIME" in os.environ
 CROWD = BUILD / "brenvik-crowd"
 MOST = 0.005  # seconds that 99 of 100 calls of the witness may take
 MEAN_LIFE, MEAN_PAUSE = 30.0, 5.0  # seconds, of a client and between its calls
-MOST_GROWN = 2 << 10  # KiB, between two crowds of the same size
+MOST_GROWN = 2 << 10  # KiB; a crowd of 4,000 that was not given back is 9 MiB
 
 
 @contextlib.contextmanager
@@ -74,7 +75,7 @@ class Load(test_siege.HeavilyUsed):
         self.assertEqual((process.wait(), counts["failures"]), (0, 0), counts)
         return counts
 
-    def test_4000_clients_come_and_go_beside_one_that_does_not_notice(self):
+    def test_a_crowd_comes_and_goes_beside_one_that_does_not_notice(self):
         print(f"{CLIENTS} clients, {SECONDS:g} s, BRENVIK_LOAD_SEED={SEED}", flush=True)
         with wire.Client() as first:
             self.assertEqual(first.set_preference("com.example.large", "key", plistlib.dumps(os.urandom(30000))), 0)
@@ -103,7 +104,7 @@ class Load(test_siege.HeavilyUsed):
         print(f"memory of the daemon: {at_start} KiB at the start, {memory} KiB after the first crowd, {now} KiB at the end",
               flush=True)
         if not SANITIZED:
-            self.assertLess(now - memory, MOST_GROWN, "KiB")
+            self.assertLess(now - at_start, MOST_GROWN, "KiB")
 
 
 if __name__ == "__main__":
