@@ -128,6 +128,15 @@ static void forget(pid_t id) {
   if (thread != NULL) *thread = threads[--threadCount];
 }
 
+static void killAtCall(pid_t process, pid_t thread, long number) {
+  const char* const name = nameOf(thread);
+  killAll(process);
+  char line[128];
+  snprintf(line, sizeof line, "killed %ld %s", number, name);
+  say(line);
+  exit(0);
+}
+
 // A thread stopped that is still there. Returns true when it was at a call that counts.
 static bool atCall(pid_t id, int status, bool isReady) {
   struct thread* thread = threadOf(id);
@@ -163,6 +172,41 @@ static void holdUntilOver(pid_t process, pid_t child) {
   exit(0);  // the child, which is traced, goes on with our end
 }
 
+// Waits for a thread to stop; 0 when one has ended, or a signal came.
+static pid_t nextStop(int* status) {
+  const pid_t id = waitpid(-1, status, __WALL);
+  if (id >= 0 && WIFSTOPPED(*status)) return id;
+  if (id >= 0) forget(id);
+  if (id < 0 && errno == ECHILD) threadCount = 0;
+  if (id < 0 && errno != ECHILD && errno != EINTR) fail("waitpid");
+  return 0;
+}
+
+// Goes on with the process until it has ended, SIGTERM has come or the wanted call is there; returns how many
+// calls were counted.
+static long trace(pid_t process, long wanted) {
+  bool isReady = false;
+  long calls = 0;
+  while (!isOver && threadCount > 0) {
+    if (!isReady && haveAllEntered()) {
+      isReady = true;
+      say("ready");
+    }
+    int status = 0;
+    const pid_t id = nextStop(&status);
+    if (id == 0) continue;
+    if (status >> 16 == PTRACE_EVENT_VFORK) {
+      unsigned long child = 0;
+      if (ptrace(PTRACE_GETEVENTMSG, id, NULL, &child) != 0) fail("PTRACE_GETEVENTMSG");
+      holdUntilOver(process, (pid_t)child);
+    } else {
+      if (atCall(id, status, isReady) && ++calls == wanted) killAtCall(process, id, calls);
+      if (WSTOPSIG(status) == kSystemCallStop) goOn(id, 0);
+    }
+  }
+  return calls;
+}
+
 int main(int count, char* arguments[]) {
   if (count != 3) {
     fprintf(stderr, "usage: kill-at PID NUMBER|fork\n");
@@ -170,7 +214,6 @@ int main(int count, char* arguments[]) {
   }
   const pid_t process = (pid_t)atoi(arguments[1]);
   const bool atFork = strcmp(arguments[2], "fork") == 0;
-  const long wanted = atFork ? -1 : atol(arguments[2]);
   struct sigaction action = {.sa_handler = end};
   sigaction(SIGTERM, &action, NULL);
   sigset_t term;
@@ -179,40 +222,8 @@ int main(int count, char* arguments[]) {
   if (atFork) sigprocmask(SIG_BLOCK, &term, NULL);  // taken while the child is held
 
   attach(process, kOptions | (atFork ? PTRACE_O_TRACEVFORK : 0));
-  bool isReady = false;
-  long calls = 0;
-  char line[128];
-  while (!isOver && threadCount > 0) {
-    if (!isReady && haveAllEntered()) {
-      isReady = true;
-      say("ready");
-    }
-    int status = 0;
-    const pid_t id = waitpid(-1, &status, __WALL);
-    if (id < 0) {
-      if (errno == EINTR) continue;
-      if (errno == ECHILD) break;
-      fail("waitpid");
-    }
-    if (!WIFSTOPPED(status)) {
-      forget(id);
-      continue;
-    }
-    if (atFork && status >> 16 == PTRACE_EVENT_VFORK) {
-      unsigned long child = 0;
-      if (ptrace(PTRACE_GETEVENTMSG, id, NULL, &child) != 0) fail("PTRACE_GETEVENTMSG");
-      holdUntilOver(process, (pid_t)child);
-    }
-    if (atCall(id, status, isReady) && ++calls == wanted) {
-      const char* const name = nameOf(id);
-      killAll(process);
-      snprintf(line, sizeof line, "killed %ld %s", calls, name);
-      say(line);
-      return 0;
-    }
-    if (WSTOPSIG(status) == kSystemCallStop) goOn(id, 0);
-  }
-  snprintf(line, sizeof line, "counted %ld", calls);
+  char line[64];
+  snprintf(line, sizeof line, "counted %ld", trace(process, atFork ? -1 : atol(arguments[2])));
   say(line);
   return 0;  // what is still traced goes on
 }
