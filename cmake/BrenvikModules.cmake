@@ -125,11 +125,14 @@ function(brenvik_fuzz_target name)
   set_tests_properties(${name} PROPERTIES LABELS "corpus" TIMEOUT 600)
 endfunction()
 
-# brenvik_e2e_test(<name> [TIMEOUT <seconds>] [CLASSES <classes>...])
-# tests/e2e/<name>.py in the sandbox, against the daemon of this build; with CLASSES one test for each class of
-# it, so that they run beside each other. Needs root; skipped, and said so, without.
+# brenvik_e2e_test(<name> [FOLDER <folder>] [TIMEOUT <seconds>] [CLASSES <classes>...])
+# tests/e2e/<name>.py, or that of another folder of tests/, in the sandbox, against the daemon of this build; with
+# CLASSES one test for each class of it, so that they run beside each other. Needs root; skipped, and said so, without.
 function(brenvik_e2e_test name)
-  cmake_parse_arguments(ARG "" "TIMEOUT" "CLASSES" ${ARGN})
+  cmake_parse_arguments(ARG "" "FOLDER;TIMEOUT" "CLASSES" ${ARGN})
+  if(NOT ARG_FOLDER)
+    set(ARG_FOLDER e2e)
+  endif()
   if(NOT ARG_TIMEOUT)
     set(ARG_TIMEOUT 300)
   endif()
@@ -142,7 +145,8 @@ function(brenvik_e2e_test name)
       set(test e2e_${name})
     endif()
     add_test(NAME ${test}
-      COMMAND ${PROJECT_SOURCE_DIR}/tests/e2e/sandbox ${PROJECT_BINARY_DIR} /usr/bin/python3 -W error::ResourceWarning ${name}.py ${class})
+      COMMAND ${PROJECT_SOURCE_DIR}/tests/e2e/sandbox ${PROJECT_BINARY_DIR} /usr/bin/python3 -W error::ResourceWarning
+        ../${ARG_FOLDER}/${name}.py ${class})
     set_tests_properties(${test} PROPERTIES LABELS "e2e" TIMEOUT ${ARG_TIMEOUT} SKIP_RETURN_CODE 77
                          COST ${ARG_TIMEOUT})  # the longest first: they mostly wait
   endforeach()

@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 // The composition root: the only file of the helper that names a Linux class.
 
+#include <malloc.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 
@@ -278,7 +279,8 @@ int run() {
                                     },
                                 .idlePeriod = std::chrono::milliseconds(BRENVIK_IDLE_MILLISECONDS),
                                 .describeCaller = describeCaller,
-                                .onChange = [&telling] { telling.changed(); }};
+                                .onChange = [&telling] { telling.changed(); },
+                                .releaseMemory = [] { (void)::malloc_trim(0); }};
   const auto endWork = [&telling, &serving] {
     telling.end();
     if (serving != nullptr) serving->shutDown();

@@ -5,6 +5,9 @@
 The daemon is one of this build that leaves after 10 milliseconds instead of 10 seconds. Each request comes from a
 new client after a pause that is made longer while the process is still there and shorter when it had left, so that
 the pauses stay around the edge.
+
+BRENVIK_EDGE_REQUESTS says how many a service manager's daemon is asked (default 1000), BRENVIK_EDGE_SEED makes other pauses:
+tests/everywhere/idle-edge does so a hundred thousand times.
 """
 import os
 import random
@@ -18,7 +21,8 @@ import harness
 import wire
 from harness import SOCKET, Daemon, Logs, entitle, listen, main
 
-REQUESTS = 1000
+REQUESTS = int(os.environ.get("BRENVIK_EDGE_REQUESTS", 1000))
+SEED = int(os.environ.get("BRENVIK_EDGE_SEED", 20))
 ALONE = 300  # of these each start waits for us
 IDLE = 0.010  # seconds
 
@@ -44,7 +48,7 @@ class IdleEdge(unittest.TestCase):
         raise AssertionError("stopped twenty times in a row before it answered")
 
     def place_requests(self, requests, ask):
-        generator = random.Random(20)
+        generator = random.Random(SEED)
         pause, met_alive = IDLE, 0
         for number in range(requests):
             time.sleep(pause * generator.uniform(0.9, 1.1))
@@ -58,7 +62,7 @@ class IdleEdge(unittest.TestCase):
         self.assertGreater(met_alive, requests / 20, "the pauses were beyond the edge")
         self.assertGreater(self.lives, requests / 20, "the pauses were short of the edge")
 
-    def test_socket_activated_1000_requests_around_the_idle_edge_are_all_answered(self):
+    def test_socket_activated_all_requests_around_the_idle_edge_are_answered(self):
         listening = listen()
         self.addCleanup(listening.close)
         statuses = []
@@ -84,7 +88,7 @@ class IdleEdge(unittest.TestCase):
         self.assertEqual(set(statuses), {0})
         self.assertTrue(SOCKET.exists())
 
-    def test_standing_alone_300_requests_around_the_idle_edge_are_all_answered(self):
+    def test_standing_alone_all_requests_around_the_idle_edge_are_answered(self):
         daemons = []
 
         def ask():

@@ -355,7 +355,34 @@ def behave_well(end, say):
          "longest": waits[-1]})
 
 
-class Siege(HelperTest):
+class HeavilyUsed(HelperTest):
+    """A daemon of which nothing may be left that it was not before."""
+
+    def descriptors(self):
+        """What the daemon has open. Files of preferences it may keep open, sixteen at most."""
+        links = []
+        for number in os.listdir(f"/proc/{self.daemon.pid}/fd"):
+            with contextlib.suppress(FileNotFoundError):  # closed since it was listed
+                links.append(re.sub(r":.*", "", os.readlink(f"/proc/{self.daemon.pid}/fd/{number}")))
+        preferences = [link for link in links if "/Library/Preferences/" in link]
+        self.assertLessEqual(len(preferences), 16)
+        return sorted(link for link in links if link not in preferences)
+
+    def settle(self):
+        """What the daemon has open once that has not changed for five seconds: requests to the network take a while."""
+        last, since = None, 0.0
+        end = time.monotonic() + 90
+        while time.monotonic() < end:
+            now = self.descriptors()
+            if now != last:
+                last, since = now, time.monotonic()
+            elif time.monotonic() - since > 5:
+                break
+            time.sleep(0.05)
+        return collections.Counter(last)
+
+
+class Siege(HeavilyUsed):
     def prepare(self):
         self.need_descriptors(8192)
         entitle("51-mobile.plist", user="mobile")
@@ -384,16 +411,6 @@ class Siege(HelperTest):
         if not SANITIZED:
             self.assertEqual(blamed, [], "waits from when to when, in seconds")
 
-    def descriptors(self):
-        """What the daemon has open. Files of preferences it may keep open, sixteen at most."""
-        links = []
-        for number in os.listdir(f"/proc/{self.daemon.pid}/fd"):
-            with contextlib.suppress(FileNotFoundError):  # closed since it was listed
-                links.append(re.sub(r":.*", "", os.readlink(f"/proc/{self.daemon.pid}/fd/{number}")))
-        preferences = [link for link in links if "/Library/Preferences/" in link]
-        self.assertLessEqual(len(preferences), 16)
-        return sorted(link for link in links if link not in preferences)
-
     def use_everything(self):
         """Queues, databases and the like are made on first use, and stay."""
         with wire.Client() as client:
@@ -419,19 +436,6 @@ class Siege(HelperTest):
             return b"a token" in reply
         eventually(is_open, 60)
         time.sleep(1)
-
-    def settle(self):
-        """What the daemon has open once that has not changed for five seconds: requests to the network take a while."""
-        last, since = None, 0.0
-        end = time.monotonic() + 90
-        while time.monotonic() < end:
-            now = self.descriptors()
-            if now != last:
-                last, since = now, time.monotonic()
-            elif time.monotonic() - since > 5:
-                break
-            time.sleep(0.05)
-        return collections.Counter(last)
 
     def test_a_well_behaved_client_is_served_all_the_while_and_nothing_is_left_behind(self):
         print(f"{SECONDS:g} s, BRENVIK_SIEGE_SEED={SEED}", flush=True)

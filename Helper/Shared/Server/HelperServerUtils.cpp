@@ -19,6 +19,10 @@ namespace brenvik {
 namespace {
 
 constexpr std::chrono::duration<double> kNoTimeOut{std::numeric_limits<double>::max()};
+// A client costs the heap about 2 KiB: what fewer of them leave is less than the helper itself takes.
+constexpr std::size_t kManyClients = 256;
+// What belongs to a client's process is freed when the process has ended, a little after its port died.
+constexpr std::chrono::seconds kUntilAllIsFree{1};
 
 [[noreturn]] void assertionFailed(const char* expression, const char* function, const char* source,
                                   int line) {
@@ -284,6 +288,7 @@ KernelReturn ServerContext::admit(PortName callerPort, PortName* clientPort, con
   {
     const Locked lock(*this);
     clients_.emplace(&deathWatch, std::move(made));
+    mostClients_ = std::max(mostClients_, clients_.size());
   }
   const bool isServed = client.source().addTo(platform_.loop);
   deathWatch.setInvalidationCallback(
@@ -309,12 +314,36 @@ void ServerContext::TearDownClient(const Locked&, DeathWatch& deathWatch) noexce
   (void)clients_.extract(&deathWatch);
 }
 
+// True once, and then again after as many have come and gone.
+bool ServerContext::haveMostClientsGone(const Locked&) noexcept {
+  if (mostClients_ < kManyClients || clients_.size() > mostClients_ / 8) return false;
+  mostClients_ = clients_.size();
+  return true;
+}
+
 void ServerContext::clientPortDied(DeathWatch& deathWatch) {
   Locked lock(*this);
   TearDownClient(lock, deathWatch);
   armIdleTimerIfIdle(lock);
+  const bool isMuchFree = haveMostClientsGone(lock);
   lock.unlock();
   tellOfChange();
+  if (isMuchFree) releaseMemorySoon();
+}
+
+void ServerContext::releaseMemorySoon() noexcept {
+  if (!platform_.releaseMemory || releaseTimer_ != nullptr) return;
+  try {
+    releaseTimer_ = platform_.loop.addTimer(
+        kUntilAllIsFree, std::chrono::nanoseconds::zero(),
+        [this] {
+          const auto once = std::move(releaseTimer_);
+          platform_.releaseMemory();
+        },
+        [] {});
+  } catch (const std::bad_alloc&) {
+    // The heap keeps it.
+  }
 }
 
 // ---- the functions ----

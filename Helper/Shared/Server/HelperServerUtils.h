@@ -50,6 +50,9 @@ struct ServerPlatform {
   std::function<void()> onChange = {};
   // The clock of the idle period, for reporting how much of it is left.
   std::function<std::chrono::nanoseconds()> now = timeSinceBoot;
+  // Gives freed memory back to the system. Called a second after most of many clients have gone: between what
+  // stays, the heap would otherwise keep what they used. Main thread, without a lock; must not throw.
+  std::function<void()> releaseMemory = {};
 };
 
 // The server; one per process. Destroying it tears down every client and gives the service port back.
@@ -98,6 +101,8 @@ class ServerContext {
   void armIdleTimerIfIdle(Locked& lock);  // gives the lock up for a moment when the timer cannot be made
   void cancelIdleTimer(const Locked& lock) noexcept;
   void idleTimerTick();
+  bool haveMostClientsGone(const Locked& lock) noexcept;
+  void releaseMemorySoon() noexcept;
   void TearDownClient(const Locked& lock, DeathWatch& deathWatch) noexcept;
 
   const ServerPlatform platform_;
@@ -107,10 +112,12 @@ class ServerContext {
   std::shared_ptr<RoutineSource> serviceSource_;
   RunLoop* runLoop_ = nullptr;  // recorded by run()
   std::function<bool()> idleCheck_;
+  std::unique_ptr<LoopSource> releaseTimer_;  // while memory is to be given back; main thread only
 
   mutable std::mutex mutex_;  // guards everything below
   std::unique_ptr<LoopSource> idleTimer_;
   std::map<const DeathWatch*, std::unique_ptr<Client>> clients_;
+  std::size_t mostClients_ = 0;  // since memory was given back
   std::uint32_t busyMask_ = 0;
   std::array<const char*, 32> busyReasons_{};  // valid for the bits that are set
   std::chrono::nanoseconds nextIdleTick_{0};   // when the idle timer fires next

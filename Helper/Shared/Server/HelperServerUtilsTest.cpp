@@ -228,6 +228,24 @@ TEST_F(ServerTest, WhoeverIsToldOfAChangeMayAskForTheFacts) {
   EXPECT_EQ(clients, (std::vector<std::size_t>{1, 0, 0, 0}));
 }
 
+TEST_F(ServerTest, MemoryIsGivenBackOnceMostOfManyClientsHaveGoneAndNotForAFew) {
+  std::vector<std::size_t> left;
+  platform.releaseMemory = [&] { left.push_back(server->facts().clients); };
+  create();
+  for (int i = 0; i < 255; ++i) ASSERT_EQ(checkIn(), kern::success);
+  for (std::size_t i = 0; i < 255; ++i) clientDies(i);
+  clock.advance(5s);
+  EXPECT_TRUE(left.empty());
+  for (int i = 0; i < 256; ++i) ASSERT_EQ(checkIn(), kern::success);
+  for (std::size_t i = 0; i < 256; ++i) clientDies(255 + i);
+  clock.advance(999ms);
+  EXPECT_TRUE(left.empty());
+  clock.advance(1ms);
+  EXPECT_EQ(left, std::vector<std::size_t>{0});
+  clock.advance(5s);
+  EXPECT_EQ(left.size(), 1U);
+}
+
 TEST_F(ServerTest, WithoutAHostedServerTheProcessStopsAtTheFirstTick10SecondsAfterTheLastClient) {
   create();
   ASSERT_EQ(checkIn(), kern::success);

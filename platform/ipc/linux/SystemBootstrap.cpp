@@ -4,10 +4,12 @@
 
 #include <fcntl.h>
 #include <grp.h>
+#include <poll.h>
 #include <sys/file.h>
 #include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -31,12 +33,37 @@ namespace {
 constexpr int kLockTries = 100;
 constexpr std::chrono::milliseconds kLockPause{10};
 
-// Whether somebody listens behind a socket file. Only a refusal says no: a full backlog, another kind of
+// Another process than our child; its number may have been given to a new process, which then counts.
+bool hasEnded(pid_t process) noexcept {
+  const UniqueFd handle(static_cast<int>(::syscall(SYS_pidfd_open, process, 0U)));
+  if (!handle.isValid()) return errno == ESRCH;
+  pollfd ending{handle.get(), POLLIN, 0};
+  return ::poll(&ending, 1, 0) > 0;
+}
+
+enum class Listener { none, alive, ended };
+
+// Who listens behind a socket file. Only a refusal says that nobody does: a full backlog, another kind of
 // socket and a probe that cannot be made at all leave the file where it is.
-bool isAlive(const sockaddr_un& address) noexcept {
+Listener listenerAt(const sockaddr_un& address) noexcept {
   const UniqueFd probe = makeSocket(Blocking::no);
-  if (connectSocket(probe.get(), address) == 0) return true;
-  return errno != ECONNREFUSED && errno != ENOENT;
+  if (connectSocket(probe.get(), address) != 0) {
+    return errno == ECONNREFUSED || errno == ENOENT ? Listener::none : Listener::alive;
+  }
+  const auto peer = peerOf(probe.get());
+  // 0: a process that this one's namespace does not show
+  return peer && peer->pid != 0 && hasEnded(peer->pid) ? Listener::ended : Listener::alive;
+}
+
+// A process that is killed while it makes a child leaves that child with copies of its descriptors until the
+// child becomes another program: nobody serves the socket then, and it is closed in a moment.
+bool isServed(const sockaddr_un& address) noexcept {
+  for (int i = 0; i < kLockTries; ++i) {
+    const Listener listener = listenerAt(address);
+    if (listener != Listener::ended) return listener == Listener::alive;
+    std::this_thread::sleep_for(kLockPause);
+  }
+  return true;  // whoever has it now keeps it
 }
 
 // The group's number; root's when there is no such group. Nothing when that cannot be found out.
@@ -106,7 +133,7 @@ UniqueFd SystemBootstrap::listenAt(const std::string& path, const char* serviceN
       logUnified(LogLevel::error, "%s is not a socket, and stays as it is", path.c_str());
       return {};
     }
-    if (isAlive(*address)) {
+    if (isServed(*address)) {
       logUnified(LogLevel::error, "another process already serves %s", path.c_str());
       return {};
     }

@@ -11,7 +11,8 @@ namespace brenvik {
 // Named services as socket files in one directory. If the service manager already listens for a service
 // (sd_listen_fds(3), a descriptor named after the service), its socket is used and the file stays the
 // manager's. Otherwise this class makes the directory (mode 0755) and the socket (mode 0660, owned by root
-// and the group). It replaces a stale socket file and fails if somebody listens there. Main thread only.
+// and the group). It replaces a stale socket file and fails if somebody listens there. If the process that
+// listened has ended, it waits up to a second for others that still hold its socket. Main thread only.
 class SystemBootstrap final : public Bootstrap {
  public:
   // `group`: the group that may connect; root's group if there is no group of that name. Only root can set

@@ -1024,6 +1024,28 @@ TEST_F(ServiceTest, ANameThatALiveProcessHoldsIsRefusedAndSaidWhy) {
   EXPECT_TRUE(connect().isValid()) << "the first is not disturbed";
 }
 
+TEST_F(ServiceTest, ASocketThatAChildOfAKilledProcessStillHoldsIsReplacedOnceTheChildLetsGo) {
+  const pid_t killed = ::fork();
+  ASSERT_GE(killed, 0);
+  if (killed == 0) {
+    const UniqueFd inherited(::socket(AF_UNIX, SOCK_SEQPACKET, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strcpy(address.sun_path, path().c_str());
+    if (::bind(inherited.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
+        ::listen(inherited.get(), 8) != 0) {
+      ::_exit(1);
+    }
+    if (::fork() == 0) (void)::accept(inherited.get(), nullptr, nullptr);  // until somebody has looked
+    ::_exit(0);
+  }
+  int status = -1;
+  ASSERT_EQ(::waitpid(killed, &status, 0), killed);
+  ASSERT_EQ(status, 0);
+  listen();
+  EXPECT_TRUE(connect().isValid());
+}
+
 TEST_F(ServiceTest, WhoeverStartsAtTheSameTimeWaitsForTheOtherToBeDone) {
   const UniqueFd lock(::open((directory + "/.service.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
   ASSERT_EQ(::flock(lock.get(), LOCK_EX), 0);
