@@ -97,6 +97,8 @@ TEST_F(FileSystemManagerTest, CopyingADirectoryOntoAFileGives17AndChangesNothing
   const std::string file = dir.file("file", "kept");
   EXPECT_EQ(manager.copyItem(dir / "from", file), 17);
   EXPECT_EQ(manager.moveItem(dir / "from", file), 17);
+  EXPECT_EQ(manager.moveItemWithOwner(dir / "from", file, 4711, 4712), 17);
+  EXPECT_EQ(statOf(dir / "from").st_uid, ::getuid()) << "nobody is given what stays";
   EXPECT_EQ(contentOf(file), "kept");
   EXPECT_EQ(contentOf(dir / "from/name"), "new");
   EXPECT_TRUE(files.calls.empty());
@@ -226,6 +228,28 @@ TEST_F(FileSystemManagerTest, TheSourceItselfIsGivenToTheOwnerBeforeItIsMoved) {
   EXPECT_EQ(statOf(dir / "tree").st_uid, ::getuid());  // the source was given away, too
   EXPECT_EQ(statOf(dir / "copy").st_uid, ::getuid());
   EXPECT_EQ(statOf(dir / "copy/below").st_uid, 4711u);  // but nothing below it
+}
+
+TEST_F(FileSystemManagerTest, TheSourceOfAMergeIsGivenToTheOwnerBefore) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to give files away";
+  const std::string there = dir.file("there", "old");
+  EXPECT_EQ(manager.moveItemWithOwner(dir.file("file", "new"), there, 4711, 4712), 0);
+  EXPECT_EQ(contentOf(there), "new");
+  EXPECT_EQ(statOf(there).st_uid, 4711u);
+  EXPECT_EQ(statOf(there).st_gid, 4712u);
+
+  EXPECT_EQ(manager.moveItemWithOwner(dir.file("other", "x"), dir.directory("to"), 4713, 4714), 0);
+  EXPECT_EQ(statOf(dir / "to/other").st_uid, 4713u);
+  EXPECT_EQ(statOf(dir / "to/other").st_gid, 4714u);
+
+  // Of a directory that both have it is the source that changes hands; this one stays, for a file in it
+  // cannot be taken.
+  dir.file("from/tree/file", "x");
+  dir.directory("to/tree");
+  files.failAt("moveItem", "tree/file", FileOutcome::failure(EIO));
+  EXPECT_EQ(manager.moveItemWithOwner(dir / "from/tree", dir / "to", 4715, 4716), 0);
+  EXPECT_EQ(statOf(dir / "from/tree").st_uid, 4715u);
+  EXPECT_EQ(statOf(dir / "from/tree").st_gid, 4716u);
 }
 
 TEST_F(FileSystemManagerTest, AMergeReplacesFilesAndKeepsWhatOnlyTheDestinationHas) {

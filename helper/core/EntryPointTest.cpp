@@ -105,7 +105,10 @@ TEST_F(EntryPointTest, ALibraryThatMakesNoServerHostsNone) {
 
 TEST_F(EntryPointTest, AServiceThatCannotBeSetUpIsLoggedTwiceAndExitsWith1AfterStoppingTheHostedServer) {
   bootstrap.refuseWith = kern::noAccess;
+  std::size_t linesBeforeTheStop = 0;
+  baseband.whenStopped = [&] { linesBeforeTheStop = log.entries().size(); };
   EXPECT_EQ(runHelper(baseband, platform, requests, endWork), 1);
+  EXPECT_EQ(linesBeforeTheStop, 1U) << "the second line comes after the stop";
   EXPECT_EQ(
       log.entries(),
       (std::vector{

@@ -4,8 +4,13 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <array>
 #include <cstring>
+#include <limits>
+#include <memory>
+#include <string>
+#include <utility>
 #include <vector>
 
 #include "platform/base/fakes/FailingAllocations.h"
@@ -28,8 +33,13 @@ class ServerTest : public testing::Test {
   }
 
   KernelReturn checkIn() {
+    clientPort = 0x7777;  // what is not the server's must not stay
     callerPort = ports.adoptSendRight();
     return BVMobileHelperCheckIn(platform, server->servicePort(), callerPort, &clientPort, AuditToken{});
+  }
+  void countDown() {
+    ReleaseBusyToken(*server, AcquireBusyToken(*server));
+    ASSERT_TRUE(idleTimerRuns());
   }
   // The client whose check-in was the n-th dies.
   void clientDies(std::size_t n) { sources.deathWatches.at(n)->tellDeath(); }
@@ -43,12 +53,14 @@ class ServerTest : public testing::Test {
   PortServerRegistry registry;
   bool entitled = true;
   std::string askedEntitlement;
+  AuditToken askedCaller{};
   ServerPlatform platform{ports,
                           bootstrap,
                           sources,
                           loop,
-                          [this](const char* name, const AuditToken&) {
+                          [this](const char* name, const AuditToken& caller) {
                             askedEntitlement = name;
+                            askedCaller = caller;
                             return entitled;
                           },
                           registry};
@@ -131,7 +143,27 @@ TEST_F(ServerTest, DestructionTearsEveryClientDownAndGivesThePortBack) {
   create();
   ASSERT_EQ(checkIn(), kern::success);
   ASSERT_EQ(checkIn(), kern::success);
+  const PortName servicePort = server->servicePort();
+  std::vector<std::string> order;
+  const auto note = [&](std::string what) {
+    return [&, what] {
+      order.push_back(what + (LookupServer(registry, servicePort) == nullptr ? ", without port" : ""));
+    };
+  };
+  sources.routineSources[0]->whenInvalidated = note("service");
+  sources.routineSources[1]->whenInvalidated = note("client");
+  sources.deathWatches[0]->whenInvalidated = note("watch");
+  auto idleCheck = std::make_shared<int>(0);
+  const std::weak_ptr<int> isHeld = idleCheck;
+  SetIdleCheck(server.get(), [held = std::exchange(idleCheck, nullptr)] { return held != nullptr; });
+  const auto serviceEnds = sources.routineSources[0]->whenInvalidated;
+  sources.routineSources[0]->whenInvalidated = [&] {
+    EXPECT_TRUE(isHeld.expired()) << "the idle check goes first";
+    serviceEnds();
+  };
   DestroyServer(std::move(server));
+  EXPECT_EQ(order, (std::vector<std::string>{"service", "watch, without port", "client, without port"}));
+  for (const auto& watch : sources.deathWatches) EXPECT_FALSE(watch->hasCallback()) << "it names the server";
   EXPECT_EQ(registry.size(), 0U);
   EXPECT_TRUE(ports.receiveRights.empty());
   EXPECT_TRUE(ports.sendRights.empty());
@@ -157,6 +189,33 @@ TEST_F(ServerTest, RunServerRunsTheLoopAgainAfterEachSourceUntilStopped) {
   EXPECT_EQ(RunServer(*server), static_cast<std::int32_t>(RunResult::stopped));
   EXPECT_EQ(loop.runs, 3);
   EXPECT_EQ(loop.stops, 1);
+}
+
+TEST_F(ServerTest, RunServerRunsTheLoopWithoutATimeOutAndUntilASourceWasHandled) {
+  class LoopOfOneRun final : public RunLoop {
+   public:
+    RunResult run(std::chrono::duration<double> timeOut, ReturnAfterSource after) override {
+      EXPECT_EQ(timeOut.count(), std::numeric_limits<double>::max());
+      EXPECT_EQ(after, ReturnAfterSource::yes);
+      server->stop();
+      return RunResult::stopped;
+    }
+    void stop() noexcept override {}
+    std::unique_ptr<DescriptorSource> addDescriptor(int, Interest, DescriptorHandler) override {
+      return nullptr;
+    }
+    std::unique_ptr<LoopSource> addTimer(std::chrono::nanoseconds, std::chrono::nanoseconds,
+                                         std::function<void()>, std::function<void()>) override {
+      return nullptr;
+    }
+    ServerContext* server = nullptr;
+  } oneRun;
+  const ServerPlatform its{ports, bootstrap, sources, oneRun, platform.hasEntitlement, registry};
+  server = CreateServer(its, kServiceName, routines);
+  ASSERT_NE(server, nullptr);
+  oneRun.server = server.get();
+  EXPECT_EQ(RunServer(*server), static_cast<std::int32_t>(RunResult::stopped));
+  server.reset();
 }
 
 // ---- the idle rule ----
@@ -430,9 +489,7 @@ TEST_F(ServerTest, LinesOfACheckInCarryItsRoutine) {
 
 TEST_F(ServerTest, ACallerWithoutTheEntitlementGets35AndNoPortAndTheIdleStateIsUnchanged) {
   create();
-  const auto token = AcquireBusyToken(*server);
-  ReleaseBusyToken(*server, token);
-  ASSERT_TRUE(idleTimerRuns());
+  countDown();
   clock.advance(5s);
   entitled = false;
   EXPECT_EQ(checkIn(), 35);
@@ -505,19 +562,26 @@ TEST_F(ServerTest, AFailedPortCallPassesItsCodeThrough) {
 
 TEST_F(ServerTest, ASourceOrDeathWatchThatCannotBeMadeGives5AndLeavesNoState) {
   create();
+  const auto expectRefusalWithoutState = [&] {
+    EXPECT_EQ(checkIn(), kern::failure);
+    EXPECT_EQ(clientPort, kNullPort);
+    EXPECT_EQ(ports.receiveRights.size(), 1U);
+    EXPECT_EQ(ports.sendRights, (std::map<PortName, int>{{callerPort, 1}}))
+        << "of the new port none, the caller's stays";
+    EXPECT_EQ(ports.failedDrops, 0);
+    EXPECT_EQ(registry.size(), 1U);
+    EXPECT_EQ(server->facts().clients, 0U);
+    ports.sendRights.clear();
+  };
   sources.refuseRoutineSources = true;
-  EXPECT_EQ(checkIn(), kern::failure);
+  expectRefusalWithoutState();
   sources.refuseRoutineSources = false;
   sources.refuseDeathWatches = true;
-  EXPECT_EQ(checkIn(), kern::failure);
+  expectRefusalWithoutState();
   EXPECT_FALSE(sources.routineSources.back()->valid);
   sources.refuseDeathWatches = false;
   sources.refuseToBeAdded = true;
-  EXPECT_EQ(checkIn(), kern::failure);
-  EXPECT_EQ(clientPort, kNullPort);
-  EXPECT_EQ(ports.receiveRights.size(), 1U);
-  EXPECT_EQ(registry.size(), 1U);
-  EXPECT_EQ(server->facts().clients, 0U);
+  expectRefusalWithoutState();
 }
 
 TEST_F(ServerTest, TheServerOwnsTheCallersRightFromASuccessfulCheckInOn) {
@@ -568,11 +632,12 @@ TEST_F(ServerTest, ACheckInLeavesNothingWhereverMemoryRunsOut) {
 
 TEST_F(ServerTest, ACallerWhosePortIsAlreadyDeadGets5AndIsTornDownByTheCallback) {
   create();
+  countDown();
   sources.portsAreDead = true;
   EXPECT_EQ(checkIn(), kern::failure);
   EXPECT_EQ(clientPort, kNullPort);
   EXPECT_EQ(server->facts().clients, 1U) << "the entries stay for the callback";
-  EXPECT_FALSE(idleTimerRuns());
+  EXPECT_FALSE(idleTimerRuns()) << "the countdown ended";
   clientDies(0);
   EXPECT_EQ(server->facts().clients, 0U);
   EXPECT_TRUE(idleTimerRuns());
@@ -685,6 +750,15 @@ TEST_F(CheckInHandlerTest, ACheckInReceivedWithoutTheAuditTrailerGetsMinus309) {
 TEST_F(CheckInHandlerTest, ATrailerThatJustHoldsATokenIsEnough) {
   trailer.size = 32;
   EXPECT_EQ(deliver(), kern::success);
+}
+
+TEST_F(CheckInHandlerTest, TheEntitlementIsAskedForTheCallerOfTheTrailer) {
+  const std::array<std::uint32_t, 8> words{11, 12, 13, 14, 15, 16, 17, 18};
+  static_assert(sizeof words == sizeof trailer.auditToken);
+  std::memcpy(&trailer.auditToken, words.data(), sizeof words);
+  EXPECT_EQ(deliver(), kern::success);
+  EXPECT_EQ(askedEntitlement, kAllowEntitlement);
+  EXPECT_TRUE(std::equal(words.begin(), words.end(), askedCaller.words.begin(), askedCaller.words.end()));
 }
 
 TEST_F(CheckInHandlerTest, FormIsCheckedBeforeTheDescriptorAndTheDescriptorBeforeTheTrailer) {

@@ -28,6 +28,7 @@ class FakeBasebandLibrary final : public BasebandLibrary {
   bool busy = false;
   int busyQuestions = 0;
   std::function<void()> whenStarted;
+  std::function<void()> whenStopped;
   std::string record;  // words, each followed by a blank
 
  private:
@@ -45,7 +46,10 @@ class FakeBasebandLibrary final : public BasebandLibrary {
       ++library_.busyQuestions;
       return library_.busy;
     }
-    void stop() override { library_.record += "stop "; }
+    void stop() override {
+      library_.record += "stop ";
+      if (library_.whenStopped) library_.whenStopped();
+    }
 
    private:
     FakeBasebandLibrary& library_;

@@ -4,9 +4,18 @@
 
 #include <dlfcn.h>
 #include <gtest/gtest.h>
+#include <sched.h>
+#include <sys/mount.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
+#include <cstdlib>
 #include <cstring>
+#include <filesystem>
+#include <fstream>
 #include <string>
+
+#include "platform/files/fakes/TemporaryDirectory.h"
 
 namespace brenvik {
 namespace {
@@ -81,10 +90,41 @@ TEST(LoadedBasebandLibraryTest, ALibraryIsFoundByItsNameInTheLoadersSearchPath) 
   EXPECT_EQ(inside.calls(), "?");
 }
 
-TEST(LoadedBasebandLibraryTest, ALibraryKnownToTheLoaderOnlyIsLoadedAndLacksTheFunctions) {
-  // The C library is found by its name but exports none of the functions.
-  LoadedBasebandLibrary library("libc.so.6");
+// What canHost() says of a library in a folder that only the loader's cache names: 0 yes, 1 no, 77 when this
+// process may have no cache of its own.
+int hostsALibraryOfTheCache(const std::string& folder) {
+  if (::unshare(::geteuid() == 0 ? CLONE_NEWNS : CLONE_NEWUSER | CLONE_NEWNS) != 0 ||
+      ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+      ::mount((folder + "/cache").c_str(), "/etc/ld.so.cache", nullptr, MS_BIND, nullptr) != 0) {
+    return 77;
+  }
+  LoadedBasebandLibrary library("libbrenvik-known-to-the-cache.so");
+  return library.canHost() ? 0 : 1;
+}
+
+TEST(LoadedBasebandLibraryTest, ALibraryThatOnlyTheLoadersCacheKnowsIsLoaded) {
+  const TemporaryDirectory directory;
+  const std::string folder = directory.path();
+  std::filesystem::copy_file(standin("whole"), folder + "/libbrenvik-known-to-the-cache.so");
+  std::ofstream(folder + "/conf") << folder << "\n";
+  const std::string make =
+      "PATH=$PATH:/usr/sbin:/sbin ldconfig -X -f " + folder + "/conf -C " + folder + "/cache";
+  ASSERT_EQ(std::system(make.c_str()), 0);
+  const pid_t child = ::fork();
+  if (child == 0) std::_Exit(hostsALibraryOfTheCache(folder));
+  int status = -1;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  if (WEXITSTATUS(status) == 77) GTEST_SKIP() << "no mounts of its own";
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+}
+
+TEST(LoadedBasebandLibraryTest, ALibraryWithoutTheFunctionsIsLoadedAndCannotHost) {
+  const char* const name = "libanl.so.1";  // belongs to the C library; nothing here uses it
+  ASSERT_EQ(::dlopen(name, RTLD_NOW | RTLD_NOLOAD), nullptr);
+  LoadedBasebandLibrary library(name);
   EXPECT_FALSE(library.canHost());
+  EXPECT_NE(::dlopen(name, RTLD_NOW | RTLD_NOLOAD), nullptr) << "it was looked into";
 }
 
 TEST(LoadedBasebandLibraryTest, ALibraryThatSaysItCannotHostIsNotHosted) {

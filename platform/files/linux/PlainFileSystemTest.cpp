@@ -55,6 +55,11 @@ extern "C" int renameat(int fromFolder, const char* from, int toFolder, const ch
   if (brenvik::FailingCall::failsNow("renameat, and death")) ::_exit(9);
   return static_cast<int>(::syscall(SYS_renameat2, fromFolder, from, toFolder, to, 0));
 }
+extern "C" int fchownat(int folder, const char* path, uid_t uid, gid_t gid, int flags) noexcept {
+  if (brenvik::FailingCall::failsNow("fchownat") || brenvik::FailingCall::failsNow("fchownat again"))
+    return -1;
+  return static_cast<int>(::syscall(SYS_fchownat, folder, path, uid, gid, flags));
+}
 extern "C" int fsync(int file) {
   if (brenvik::FailingCall::failsNow("fsync")) return -1;
   return static_cast<int>(::syscall(SYS_fsync, file));
@@ -331,6 +336,21 @@ TEST_F(PlainFileSystemTest, ALinkThatTakesAFoldersPlaceLeadsNoWalkOutOfTheTree) 
   EXPECT_EQ(names(), (Names{"link", "outside", "tree"}));
   EXPECT_EQ(swapped([&] { return files.removeItem(dir / "tree"); }), FileOutcome::failure(ENOTDIR));
   EXPECT_EQ(contentOf(dir / "tree/sub/own"), "x");
+}
+
+TEST_F(PlainFileSystemTest, OfATreeTheTopsFailureCountsElseTheLastOneBelow) {
+  dir.file("tree/a");
+  dir.file("tree/b");
+  const ItemAttributes mine{{}, ::getuid(), ::getgid()};
+  {
+    const FailingCall first("fchownat", EIO);
+    const FailingCall second("fchownat again", EDQUOT);
+    EXPECT_EQ(files.setAttributesOfTree(dir / "tree", mine), FileOutcome::failure(EDQUOT));
+  }
+  const FailingCall second("fchownat again", EDQUOT, 1);
+  const FailingCall top("fchownat", EIO, 2);
+  EXPECT_EQ(files.setAttributesOfTree(dir / "tree", mine), FileOutcome::failure(EIO));
+  EXPECT_EQ(second.failures(), 1);
 }
 
 }  // namespace

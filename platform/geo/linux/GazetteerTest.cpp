@@ -242,6 +242,16 @@ TEST_F(GazetteerFileTest, AnErrorOfTheLastStatementIsOneOfTheLookUpToo) {
   EXPECT_EQ(problemOf(path), "the offline gazetteer is damaged: integer overflow");
 }
 
+TEST_F(GazetteerFileTest, AViewInTheDatabaseRunsNoFunctionThatIsMoreThanACalculation) {
+  const auto path = folder / "view.db";
+  makeDatabase(path,
+               (std::string(kSmall) +
+                "create table area(id integer primary key, name); insert into land values(0, x'1A0001');"
+                "create view place as select 1 as id, rtreecheck('land') as name, 1 as area, null as town;")
+                   .c_str());
+  EXPECT_EQ(problemOf(path), "the offline gazetteer cannot be read: unsafe use of rtreecheck()");
+}
+
 TEST_F(GazetteerFileTest, BordersAndPlacesThatMakeNoSenseAreErrors) {
   const auto problemWith = [this](const std::string& sql) {
     const auto path = folder / "odd.db";

@@ -7,13 +7,21 @@
 #include <netinet/in.h>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
+#include <sys/syscall.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <thread>
 
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/geo/linux/HostResolver.h"
 #include "platform/geo/linux/StunTransaction.h"
 #include "platform/log/fakes/RecordingLog.h"
+
+extern "C" ssize_t send(int socket, const void* bytes, size_t size, int flags) {
+  if (brenvik::FailingCall::failsNow("send")) return -1;
+  return ::syscall(SYS_sendto, socket, bytes, size, flags, nullptr, 0);
+}
 
 namespace brenvik {
 namespace {
@@ -163,6 +171,26 @@ TEST_F(UdpStunNetworkTest, ASecondSendingReachesAServerThatMissedTheFirst) {
 TEST_F(UdpStunNetworkTest, APortWhereNobodyListensEndsItAtOnce) {
   Server server;
   server.refuse();
+  EXPECT_EQ(problemOf(ask(server.name)), "the STUN server cannot be reached");
+}
+
+TEST_F(UdpStunNetworkTest, ASendingWithoutRoomInTheQueueIsLikeADatagramLost) {
+  for (const int error : {EAGAIN, ENOBUFS, EINTR}) {
+    Server server;
+    std::thread serving([&] {
+      server.serveOne(
+          [](const auto& request, const auto& from, const auto& send) { send(answerTo(request, from)); });
+    });
+    const FailingCall full("send", error);
+    EXPECT_EQ(ask(server.name).address, "127.0.0.1") << error;
+    EXPECT_EQ(full.failures(), 1);
+    serving.join();
+  }
+}
+
+TEST_F(UdpStunNetworkTest, ASendingThatFailsOtherwiseEndsIt) {
+  Server server;  // would hear a second one
+  const FailingCall refused("send", EPERM);
   EXPECT_EQ(problemOf(ask(server.name)), "the STUN server cannot be reached");
 }
 

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <deque>
+#include <functional>
 #include <map>
 #include <memory>
 #include <new>
@@ -83,8 +84,11 @@ class FakeRoutineSource final : public RoutineSource {
   FakeRoutineSource(PortName servedPort, const RoutineTable& servedTable, WantTrailer trailer)
       : port(servedPort), table(servedTable), wantTrailer(trailer) {}
   bool addTo(RunLoop&) noexcept override { return added = !refuseToBeAdded; }
-  void invalidate() noexcept override { valid = false; }
+  void invalidate() noexcept override {
+    if (std::exchange(valid, false) && whenInvalidated) whenInvalidated();
+  }
 
+  std::function<void()> whenInvalidated;
   const PortName port;
   const RoutineTable& table;
   const WantTrailer wantTrailer;
@@ -101,7 +105,12 @@ class FakeDeathWatch final : public DeathWatch {
   void setInvalidationCallback(std::function<void(DeathWatch&)> callback) noexcept override {
     callback_ = std::move(callback);
   }
-  void invalidate() noexcept override { valid_ = false; }
+  void invalidate() noexcept override {
+    if (std::exchange(valid_, false) && whenInvalidated) whenInvalidated();
+  }
+  bool hasCallback() const noexcept { return callback_ != nullptr; }
+
+  std::function<void()> whenInvalidated;
 
   // The run loop notices that the port has died.
   void tellDeath() {

@@ -261,6 +261,8 @@ TEST(CatalogueLabelerTest, ManyEqualLabelsStillGetDistinctBadgesUntilThereAreNoM
   ASSERT_EQ(made.size(), 40000U);
   EXPECT_EQ(std::set<std::string>(made.begin(), made.end()).size(), 40000U);
   EXPECT_EQ(std::ranges::max(made, {}, &std::string::size).size(), 3U);
+  EXPECT_EQ(Texts(made.begin(), made.begin() + 5), (Texts{"L", "LI", "LIN", "L2", "L3"}));
+  EXPECT_EQ(Texts(made.begin() + 99, made.begin() + 103), (Texts{"L98", "L99", "1", "2"}));
   EXPECT_FALSE(
       CatalogueLabeler().localizedBadgeLabels(arrayOf(Texts(50000, "Line")), PropertyList()).hasValue());
 }
