@@ -232,6 +232,7 @@ struct Machine {
   SystemPortSources sources{ports, regions, SystemPortSources::Refusals::unlimited};
   AbstractBootstrap bootstrap{ports};
   CatalogueLabeler labeler;
+  unsigned sessions = 0;
   Machine() { setLogSink(&log); }
 };
 
@@ -262,7 +263,9 @@ class Session {
     heartbeat_.shutDown();
     server_.reset();
     clients_ = {};
-    settleWithClosing();
+    settle();
+    // Waiting for the closing thread costs more than a session does, so it may lag a little behind.
+    if (++machine_.sessions % 16 == 0) settleWithClosing();
   }
 
   void run() {
@@ -341,12 +344,18 @@ class Session {
     }
     theirs.reset();
     if ((how & 0x80) != 0) client.life.reset();  // gone before it is answered
-    settleWithClosing();
+    settle();
 
     ReceivedDatagram received;
     std::array<UniqueFd, 2> rights;
     std::array<std::byte, 1024> answer;
-    if (!receive(client.connection, answer, rights, &received)) {
+    bool isAnswered = receive(client.connection, answer, rights, &received);
+    if (!isAnswered) {
+      // A message with foreign descriptors is dropped on the closing thread, and answered then.
+      settleWithClosing();
+      isAnswered = receive(client.connection, answer, rights, &received);
+    }
+    if (!isAnswered) {
       if (replyPortOf(bytes) != 0 && received.length == 0 && isOpen(client.connection))
         require(bytes.size() < sizeof(MessageHeader));
       client.life.reset();
