@@ -33,7 +33,7 @@
 #include "platform/ipc/fakes/AbstractBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/labeler/linux/CatalogueLabeler.h"
-#include "platform/log/Log.h"
+#include "platform/log/fakes/NoLog.h"
 #include "platform/messageport/fakes/RecordingMessagePorts.h"
 #include "platform/net/fakes/FakeEchoNetwork.h"
 #include "platform/preferences/fakes/InMemoryPreferences.h"
@@ -50,12 +50,6 @@ using namespace std::chrono_literals;
 
 constexpr std::size_t kClients = 4;
 constexpr int kSteps = 32;
-
-class NoLog final : public LogSink {
- public:
-  void unified(LogLevel, std::string_view, const LogPlace&, const MessageId&) noexcept override {}
-  void bsd(SyslogPriority, std::string_view, const MessageId&) noexcept override {}
-};
 
 // Descriptors of the real loop, timers of manual time.
 class MixedLoop final : public RunLoop {

@@ -23,7 +23,7 @@
 #include "platform/base/UniqueFd.h"
 #include "platform/base/fakes/FuzzInput.h"
 #include "platform/contacts/linux/SqliteContacts.h"
-#include "platform/log/Log.h"
+#include "platform/log/fakes/NoLog.h"
 #include "platform/sqlite/ForeignDatabase.h"
 #include "platform/sqlite/Sqlite.h"
 #include "platform/sqlite/fakes/ManualSqliteTime.h"
@@ -36,12 +36,6 @@ using namespace std::chrono_literals;
 
 constexpr std::array kSuffixes{"", "-journal", "-wal"};
 using Files = std::array<std::string, kSuffixes.size()>;  // the contents by suffix; empty: no file
-
-class NoLog final : public LogSink {
- public:
-  void unified(LogLevel, std::string_view, const LogPlace&, const MessageId&) noexcept override {}
-  void bsd(SyslogPriority, std::string_view, const MessageId&) noexcept override {}
-};
 
 using Open = int (*)(const char*, int, int);
 using Unlink = int (*)(const char*);

@@ -22,18 +22,12 @@
 #include "platform/ipc/fakes/AbstractBootstrap.h"
 #include "platform/ipc/fakes/FakePorts.h"
 #include "platform/ipc/linux/SystemPortSources.h"
-#include "platform/log/Log.h"
+#include "platform/log/fakes/NoLog.h"
 #include "platform/runloop/linux/SystemQueues.h"
 
 namespace {
 
 using namespace brenvik;
-
-class NoLog final : public LogSink {
- public:
-  void unified(LogLevel, std::string_view, const LogPlace&, const MessageId&) noexcept override {}
-  void bsd(SyslogPriority, std::string_view, const MessageId&) noexcept override {}
-};
 
 struct Server {
   NoLog log;
