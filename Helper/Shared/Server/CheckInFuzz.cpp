@@ -10,60 +10,24 @@
 
 #include <array>
 #include <chrono>
-#include <cstdlib>
 #include <cstring>
 #include <span>
-#include <string>
 #include <vector>
 
 #include "Helper/Shared/Server/CheckInTable.h"
+#include "platform/base/fakes/FuzzInput.h"
 #include "platform/datagram/Datagram.h"
 #include "platform/datagram/LocalSocket.h"
 #include "platform/datagram/SealedMemory.h"
+#include "platform/ipc/fakes/AbstractBootstrap.h"
+#include "platform/ipc/fakes/FakePorts.h"
 #include "platform/ipc/linux/SystemPortSources.h"
-#include "platform/log/Log.h"
+#include "platform/log/fakes/NoLog.h"
 #include "platform/runloop/linux/SystemQueues.h"
 
 namespace {
 
 using namespace brenvik;
-
-void require(bool condition) {
-  if (!condition) std::abort();
-}
-
-class NoLog final : public LogSink {
- public:
-  void unified(LogLevel, std::string_view, const LogPlace&, const MessageId&) noexcept override {}
-  void bsd(SyslogPriority, std::string_view, const MessageId&) noexcept override {}
-};
-
-class NoRoutines final : public RoutineTable {
- public:
-  Handler find(std::int32_t) const noexcept override { return nullptr; }
-  void* context() const noexcept override { return nullptr; }
-};
-
-// A listening socket without a file.
-class AbstractBootstrap final : public Bootstrap {
- public:
-  explicit AbstractBootstrap(SystemPortSpace& ports) : ports_(ports) {
-    address.sun_family = AF_UNIX;
-    const std::string name = "brenvik-check-in-fuzz-" + std::to_string(::getpid());
-    name.copy(address.sun_path + 1, sizeof address.sun_path - 2);
-  }
-  KernelReturn checkIn(const char*, PortName* receiveRight) noexcept override {
-    UniqueFd socket = makeSocket(Blocking::no);
-    require(bindSocket(socket.get(), address) == 0 && ::listen(socket.get(), 8) == 0 &&
-            askForCredentials(socket.get()));
-    *receiveRight = ports_.adoptService(std::move(socket), "");
-    return kern::success;
-  }
-  sockaddr_un address{};
-
- private:
-  SystemPortSpace& ports_;
-};
 
 struct Server {
   NoLog log;

@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/net/linux/RouteAnswers.h"
 
 namespace brenvik {
 namespace {
@@ -25,24 +26,6 @@ constexpr std::size_t kReceiveSize = 32768;
 constexpr timeval kAnswerTimeOut{2, 0};
 
 constexpr std::size_t aligned(std::size_t length) noexcept { return (length + 3) & ~std::size_t{3}; }
-
-template <typename T>
-std::optional<T> readAt(std::span<const std::byte> bytes, std::size_t offset = 0) noexcept {
-  if (bytes.size() < offset + sizeof(T)) return std::nullopt;
-  T value;
-  std::memcpy(&value, bytes.data() + offset, sizeof value);
-  return value;
-}
-
-// Calls `visit(type, payload)` for each attribute of a run of them.
-template <typename Visit>
-void forEachAttribute(std::span<const std::byte> bytes, Visit visit) {
-  while (const auto attribute = readAt<rtattr>(bytes)) {
-    if (attribute->rta_len < sizeof(rtattr) || attribute->rta_len > bytes.size()) return;
-    visit(attribute->rta_type, bytes.subspan(sizeof(rtattr), attribute->rta_len - sizeof(rtattr)));
-    bytes = bytes.subspan(std::min(bytes.size(), aligned(attribute->rta_len)));
-  }
-}
 
 struct RouteRequest {
   nlmsghdr header;
@@ -81,83 +64,21 @@ UniqueFd sent(const RouteRequest& request) noexcept {
   return fd;
 }
 
-enum class Answer { goesOn, complete, failed };
-
-// Calls `visit(rtmsg, attributes)` for each route in a piece of the answer.
-template <typename Visit>
-Answer visitRoutes(std::span<const std::byte> piece, bool isDump, Visit& visit) {
-  while (const auto header = readAt<nlmsghdr>(piece)) {
-    if (header->nlmsg_len < sizeof(nlmsghdr) || header->nlmsg_len > piece.size()) return Answer::failed;
-    if (header->nlmsg_type == NLMSG_DONE) return Answer::complete;
-    if (header->nlmsg_type == NLMSG_ERROR) return Answer::failed;
-    const auto message = piece.subspan(sizeof(nlmsghdr), header->nlmsg_len - sizeof(nlmsghdr));
-    if (header->nlmsg_type == RTM_NEWROUTE) {
-      if (const auto route = readAt<rtmsg>(message)) visit(*route, message.subspan(aligned(sizeof(rtmsg))));
-      if (!isDump) return Answer::complete;
-    }
-    piece = piece.subspan(std::min(piece.size(), aligned(header->nlmsg_len)));
-  }
-  return Answer::goesOn;
-}
-
-// Sends the request and calls `visit(rtmsg, attributes)` for each route of the answer. False when the kernel
-// reported an error or did not answer.
-template <typename Visit>
-bool ask(const RouteRequest& request, Visit visit) {
+// Sends the request and hands each piece of the answer to `read`. False when the kernel reported an error or
+// did not answer.
+template <typename Read>
+bool ask(const RouteRequest& request, Read read) {
   const UniqueFd fd = sent(request);
   if (!fd.isValid()) return false;
-  const bool isDump = (request.header.nlmsg_flags & NLM_F_DUMP) == NLM_F_DUMP;
   std::vector<std::byte> buffer(kReceiveSize);
-  for (auto answer = Answer::goesOn; answer != Answer::complete;) {
+  for (auto answer = RouteAnswer::goesOn; answer != RouteAnswer::complete;) {
     const auto received = ::recv(fd.get(), buffer.data(), buffer.size(), 0);
     if (received < 0 && errno == EINTR) continue;
     if (received <= 0) return false;
-    answer = visitRoutes(std::span(buffer.data(), static_cast<std::size_t>(received)), isDump, visit);
-    if (answer == Answer::failed) return false;
+    answer = read(std::span<const std::byte>(buffer.data(), static_cast<std::size_t>(received)));
+    if (answer == RouteAnswer::failed) return false;
   }
   return true;
-}
-
-bool isLinkLocal(const rtmsg& route, std::span<const std::byte> destination) noexcept {
-  const auto byteAt = [&](std::size_t i) {
-    return i < destination.size() ? std::to_integer<unsigned>(destination[i]) : 0U;
-  };
-  if (route.rtm_family == AF_INET6 && route.rtm_dst_len >= 8) {
-    return byteAt(0) == 0xFF || (byteAt(0) == 0xFE && (byteAt(1) & 0xC0U) == 0x80);
-  }
-  if (route.rtm_family == AF_INET && route.rtm_dst_len >= 16) return byteAt(0) == 169 && byteAt(1) == 254;
-  return false;
-}
-
-// Calls `take(index)` for each living hop of a route with several.
-template <typename Take>
-void forEachHop(std::span<const std::byte> hops, Take take) {
-  while (const auto hop = readAt<rtnexthop>(hops)) {
-    if (hop->rtnh_len < sizeof(rtnexthop) || hop->rtnh_len > hops.size()) return;
-    if ((hop->rtnh_flags & RTNH_F_DEAD) == 0) take(hop->rtnh_ifindex);
-    hops = hops.subspan(std::min(hops.size(), aligned(hop->rtnh_len)));
-  }
-}
-
-void collect(const rtmsg& route, std::span<const std::byte> attributes, unsigned loopback,
-             std::set<unsigned>& interfaces) {
-  if (route.rtm_type != RTN_UNICAST || (route.rtm_flags & (RTNH_F_DEAD | RTM_F_CLONED)) != 0) return;
-  std::span<const std::byte> destination;
-  forEachAttribute(attributes, [&](unsigned type, std::span<const std::byte> payload) {
-    if (type == RTA_DST) destination = payload;
-  });
-  if (isLinkLocal(route, destination)) return;
-  const auto take = [&](int index) {
-    if (index > 0 && static_cast<unsigned>(index) != loopback)
-      interfaces.insert(static_cast<unsigned>(index));
-  };
-  forEachAttribute(attributes, [&](unsigned type, std::span<const std::byte> payload) {
-    if (type == RTA_OIF) {
-      if (const auto index = readAt<int>(payload)) take(*index);
-    } else if (type == RTA_MULTIPATH) {
-      forEachHop(payload, take);
-    }
-  });
 }
 
 }  // namespace
@@ -192,13 +113,8 @@ std::optional<unsigned> interfaceTo(const sockaddr& peer) {
   addAttribute(request, RTA_DST, std::span(address).first(length));
 
   std::optional<unsigned> found;
-  const bool answered = ask(request, [&](const rtmsg& route, std::span<const std::byte> attributes) {
-    if (route.rtm_type != RTN_UNICAST && route.rtm_type != RTN_LOCAL) return;
-    forEachAttribute(attributes, [&](unsigned type, std::span<const std::byte> payload) {
-      const auto index = type == RTA_OIF ? readAt<int>(payload) : std::nullopt;
-      if (index && *index > 0) found = static_cast<unsigned>(*index);
-    });
-  });
+  const bool answered =
+      ask(request, [&](std::span<const std::byte> piece) { return readRoute(piece, &found); });
   return answered ? found : std::nullopt;
 }
 
@@ -208,10 +124,9 @@ std::optional<std::set<unsigned>> interfacesWithRoutes() {
   bool answered = false;
   for (const std::uint8_t family : {std::uint8_t{AF_INET}, std::uint8_t{AF_INET6}}) {
     // A kernel without IPv6 refuses its dump; the other one still tells.
-    answered |=
-        ask(makeRequest(NLM_F_DUMP, family), [&](const rtmsg& route, std::span<const std::byte> attributes) {
-          if (route.rtm_family == family) collect(route, attributes, loopback, interfaces);
-        });
+    answered |= ask(makeRequest(NLM_F_DUMP, family), [&](std::span<const std::byte> piece) {
+      return readRoutes(piece, family, loopback, &interfaces);
+    });
   }
   if (!answered) return std::nullopt;
   return interfaces;
