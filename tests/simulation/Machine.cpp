@@ -221,7 +221,10 @@ void Machine::live() {
   life_.reset();
   world.endLife();
   pendingCalls_ = 0;
-  for (auto& [id, connection] : connections) connection.port = kNullPort;
+  // Whoever had come as far as to a reply sees the end of his channel.
+  for (auto& [id, connection] : connections) {
+    if (connection.watched != kNullPort) connection = {.process = connection.process, .isOpen = false};
+  }
   if (wasKilled) {
     const bool hadPower = std::exchange(disaster_, Disaster::none) != Disaster::powerCut;
     Disk::shared().restore(*remains_);

@@ -1128,8 +1128,25 @@ void Rules::databaseEnds(bool ok) {
   nextDatabase();
 }
 
+// What a domain holds after a death: each key what it had, or what the request under way was to give it.
+void Rules::settlesOn(const Tree& disk, const std::string& domain, Domain& there) {
+  const auto found = disk.find("/root/Library/Preferences/" + domain + ".plist");
+  const PropertyList all = found != disk.end() ? parsed(found->second.content) : PropertyList();
+  if (found != disk.end() && !all.is(PropertyList::Type::dictionary)) {
+    breach("after a death, the domain " + domain + " is not whole");
+  }
+  for (auto& [key, values] : there.keys) {
+    const PropertyList value = all.find(key);
+    if (std::find(values.begin(), values.end(), value) == values.end()) {
+      breach("after a death, the key " + key + " of the domain " + domain + " has another value");
+    }
+    values = {value};
+  }
+}
+
 void Rules::afterDeath(const Tree& disk, bool hadPower) {
   if (undo_) (*undo_)();
+  for (auto& [domain, there] : domains_) settlesOn(disk, domain, there);
   for (auto each = files_.begin(); each != files_.end();) {
     each = isHidden(each->first) ? files_.erase(each) : std::next(each);
   }

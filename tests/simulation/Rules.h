@@ -166,6 +166,8 @@ class Rules {
   void takeToken();
   void giveToken(Time earliest, Time latest);
 
+  void settlesOn(const Tree& disk, const std::string& domain, Domain& there);
+
   // The routines, by their rows.
   Expected voicemail(const Call& call);
   Expected setPreference(const Call& call);

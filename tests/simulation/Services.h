@@ -74,6 +74,7 @@ class SimulatedWeb::Request final : public WebRequest {
   void cancel() noexcept override {}
   // Gives the answer before it returns, because the caller will wait with its thread; others go on meanwhile.
   void send(std::vector<std::byte>) override {
+    if (web_.world_.isKilled()) return completion_(nullptr);
     web_.onSend(url_);
     WebAnswer answer = web_.throughTheAir(*session_, web_.answer(url_));
     web_.world_.waitFor(answer.delay);
