@@ -124,8 +124,9 @@ std::pair<ino_t, Item> itemAt(const std::string& path) {
   return {facts.st_ino, item};
 }
 
-// Whether the item is on this file system; /proc is not.
-bool isOurs(const std::string& path) {
+// What is below the root, however the root is named, but for /proc.
+bool isOurs(const std::filesystem::path& path) {
+  if (path.filename() != "proc") return true;
   struct stat root {};
   struct stat item {};
   return ::stat("/", &root) == 0 && ::lstat(path.c_str(), &item) == 0 && root.st_dev == item.st_dev;
@@ -166,7 +167,7 @@ void Disk::enter() {
 void Disk::restore(const Tree& tree) {
   stopCounting();
   for (const auto& each : fs::directory_iterator("/")) {
-    if (isOurs(each.path().string())) fs::remove_all(each.path());
+    if (isOurs(each.path())) fs::remove_all(each.path());
   }
   for (const auto& [path, item] : tree) {  // in order of the paths: a folder before what is in it
     if (S_ISDIR(item.mode)) {
@@ -198,7 +199,7 @@ void Disk::beforeChange() {
 Disk::Names Disk::namesIn(const std::string& path) {
   Names names;
   for (const auto& each : fs::directory_iterator(path)) {
-    if (!isOurs(each.path().string())) continue;
+    if (!isOurs(each.path())) continue;
     auto [inode, item] = itemAt(each.path().string());
     names.emplace(each.path().filename().string(), Name{inode, std::move(item)});
   }

@@ -362,6 +362,11 @@ void changeSurroundings(Machine& machine, Random& random) {
       machine.echo.far = random.of(std::array{SimulatedEcho::Far::answers, SimulatedEcho::Far::isSilent,
                                               SimulatedEcho::Far::isUnreachable});
       machine.echo.hasCellular = random.oneIn(2);
+      // Each silent probe is a wait of seconds; hours of them tell nothing new.
+      if (machine.echo.far == SimulatedEcho::Far::isSilent) {
+        machine.world.clock.schedule(random.upTo(5min),
+                                     [&machine] { machine.echo.far = SimulatedEcho::Far::answers; });
+      }
       break;
     case 10:
       around.outOfDescriptors = !around.outOfDescriptors && random.oneIn(2);

@@ -134,6 +134,10 @@ Machine::Machine(std::uint64_t seed, std::function<void(const std::string&)> tra
   Disk::shared().restore(firstTree());
   accounts_.accounts["mobile"] = {AccountIds{kMobile, kMobile}, "/var/mobile"};
   world.afterEachStep = [this] { observe(); };
+  world.mayWait = [this](std::string_view label) {
+    return label == "LASDUpdater" ||
+           (label == "com.norvale.otaheartbeat" && echo.far == SimulatedEcho::Far::isSilent);
+  };
   web.onSend = [this](const std::string& url) { rules.webSends(url); };
   web.onAnswer = [this](const std::string& url, const WebAnswer& answer) {
     this->trace("the web answers " + url + " with " + std::to_string(static_cast<int>(answer.kind)) + "/" +
@@ -213,7 +217,7 @@ void Machine::live() {
     rules.wasKilled();
     // What it seemed to send after its death was never sent.
     pushesSeen_ = telephony_.pushes.size();
-    notificationsSeen_ = messagePorts_.messages().size();
+    notificationsSeen_ = messagePorts_.count();
   }
   if (!wasKilled) lookForLeaks(*life_);
   life_->lasd->shutDown();
@@ -319,6 +323,11 @@ void Machine::observe() {
     trace("a push of " + push.what);
     if (!world.isKilled()) rules.pushes(push.what, push.values);
   }
+  if (notificationsSeen_ < messagePorts_.count()) observeNotifications();
+  if (rules.finding()) throw Finding{*rules.finding()};
+}
+
+void Machine::observeNotifications() {
   const auto messages = messagePorts_.messages();
   for (; notificationsSeen_ < messages.size(); ++notificationsSeen_) {
     const auto& message = messages[notificationsSeen_];
@@ -327,7 +336,6 @@ void Machine::observe() {
       rules.breach("a message to another port");
     if (!world.isKilled()) rules.notifies(parsePropertyList(message.data));
   }
-  if (rules.finding()) throw Finding{*rules.finding()};
 }
 
 void Machine::log(bool isBsd, int level, std::string_view line) {

@@ -142,6 +142,7 @@ class Machine final : public LogSink {
                   const MessageTrailer& trailer, const std::vector<std::string>& regions, Outcome* outcome);
   void check(const Call& call, const Expected& expected, const Answer& answer);
   void observe();
+  void observeNotifications();
   void log(bool isBsd, int level, std::string_view line);
   void strike();
   void lookForLeaks(Life& life);

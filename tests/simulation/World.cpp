@@ -5,19 +5,10 @@
 #include <algorithm>
 
 namespace brenvik::simulation {
-namespace {
-
-// Queues whose tasks wait: for an answer from the web, or for an echo.
-bool waits(std::string_view label) { return label == "LASDUpdater" || label == "com.norvale.otaheartbeat"; }
-
-}  // namespace
-
 // ---- queues ----
 
 SimulatedQueue::SimulatedQueue(World& world, std::string label, QualityOfService qualityOfService)
-    : world_(world),
-      tasks_(world.clock, std::move(label), qualityOfService),
-      hasThread_(waits(tasks_.label())) {
+    : world_(world), tasks_(world.clock, std::move(label), qualityOfService) {
   world_.queues_.push_back(this);
 }
 
@@ -71,8 +62,9 @@ void World::serveThread(SimulatedQueue& queue) {
 void World::runTask(SimulatedQueue& queue) {
   SimulatedQueue* const before = std::exchange(current_, &queue);
   queue.isWoken_ = false;
+  if (queue.state_ == SimulatedQueue::State::idle) queue.isOnThread_ = mayWait(queue.label());
   queue.state_ = SimulatedQueue::State::running;
-  if (queue.hasThread_) {
+  if (queue.isOnThread_) {
     if (!queue.thread_.joinable()) queue.thread_ = std::thread([this, &queue] { serveThread(queue); });
     handOver(queue);
   } else {
@@ -84,7 +76,7 @@ void World::runTask(SimulatedQueue& queue) {
 
 void World::waitFor(Time delay) {
   SimulatedQueue* const queue = current_;
-  if (isKilled_ || queue == nullptr || !queue->hasThread_) return;
+  if (isKilled_ || queue == nullptr || !queue->isOnThread_) return;
   queue->state_ = SimulatedQueue::State::waiting;
   clock.schedule(delay, [queue] { queue->isWoken_ = true; });
   std::unique_lock lock(mutex_);

@@ -56,8 +56,8 @@ struct Killed {};
 
 class World;
 
-// A serial queue of the helper. Its tasks run when the world lets them; a queue whose tasks wait for the
-// network has a thread of its own, but only one thread of the world runs at a time.
+// A serial queue of the helper. Its tasks run when the world lets them; a task that may wait for the network
+// has a thread of its own, but only one thread of the world runs at a time.
 class SimulatedQueue final : public WorkQueue {
  public:
   SimulatedQueue(World& world, std::string label, QualityOfService qualityOfService);
@@ -86,7 +86,7 @@ class SimulatedQueue final : public WorkQueue {
   enum class State { idle, running, waiting };
   World& world_;
   ManualWorkQueue tasks_;
-  const bool hasThread_;
+  bool isOnThread_ = false;  // the task that runs, or waits
   State state_ = State::idle;
   bool isWoken_ = false;  // a waiting task may go on
   // The thread, made for the first task.
@@ -140,6 +140,8 @@ class World {
   // After the helper has gone.
   void endLife();
 
+  // Whether the tasks of this queue may wait now.
+  std::function<bool(std::string_view label)> mayWait;
   // Asked in each step of the main loop whether the loop must give way to a new history.
   std::function<void()> afterEachStep;
 
