@@ -11,21 +11,12 @@
 #include <csignal>
 #include <functional>
 #include <memory>
-#include <new>
 #include <string>
 #include <utility>
 #include <vector>
 
-#include "helper/carrier/CarrierOperations.h"
-#include "helper/carrier/FileSystemManager.h"
-#include "helper/carrier/PathPolicy.h"
+#include "helper/core/Composition.h"
 #include "helper/core/EntryPoint.h"
-#include "helper/core/HelperStatus.h"
-#include "helper/core/StatusLine.h"
-#include "helper/entitlement/EntitlementCheck.h"
-#include "helper/location/GeoRequestState.h"
-#include "helper/mobile/MobileUser.h"
-#include "helper/requests/RequestTable.h"
 #include "platform/accounts/linux/PasswordDatabase.h"
 #include "platform/base/Environment.h"
 #include "platform/baseband/linux/LoadedBasebandLibrary.h"
@@ -86,68 +77,61 @@ void prepareProcess() noexcept {
   (void)::umask(022);
 }
 
-// What serves the requests: the areas, and the platform below them that only requests need.
-class Serving {
+// The platform below the requests.
+class LinuxRequestPlatform final : public RequestPlatform {
  public:
-  Serving(SystemQueues& queues, SystemRegions& regions, PasswordDatabase& accounts)
-      : queues_(queues), regions_(regions), mobile_(MobileUser::shared(accounts)) {
-    LASDUpdater::shared()->configure({.queues = queues_,
-                                      .web = web_,
-                                      .gunzip = gunzip_,
-                                      .preferences = preferences_,
-                                      .messagePorts = messagePorts_});
-    CellularHeartbeat::shared().configure({.queues = queues_, .network = echoNetwork_});
+  LinuxRequestPlatform(SystemQueues& queues, MobileUser& mobile) : queues_(queues), mobile_(mobile) {}
+  LinuxRequestPlatform(const LinuxRequestPlatform&) = delete;
+  LinuxRequestPlatform& operator=(const LinuxRequestPlatform&) = delete;
+
+  Roles roles() override {
+    return {.preferences = preferences_,
+            .files = files_,
+            .archives = ZipArchiveCopier::factory(),
+            .radio = radio_,
+            .labeler = labeler_,
+            .contacts = contacts_,
+            .web = web_,
+            .gunzip = gunzip_,
+            .messagePorts = messagePorts_,
+            .echoNetwork = echoNetwork_,
+            .voicemail = voicemailStore_,
+            .visualVoicemail = visualVoicemail_,
+            .geo = geoService_,
+            .telephony = telephonyDaemon_};
   }
-  Serving(const Serving&) = delete;
-  Serving& operator=(const Serving&) = delete;
-
-  RequestAreas& areas() noexcept { return areas_; }
-
-  // Processes that work for this one.
-  std::vector<StatusReport::Worker> workers() const {
+  std::vector<StatusReport::Worker> workers() const override {
     return {{"network", networkWorker_.isRunning()}, {"stores", storeWorker_.isRunning()}};
   }
-
-  // Ends the work of other threads.
-  void shutDown() noexcept {
-    // The first two let a transfer and an unpacking under way end, for which a check would wait.
+  // Lets a transfer and an unpacking under way end, for which a check would wait.
+  void shutDown() noexcept override {
     networkAnswers_.shutDown();
     gunzip_.shutDown();
-    LASDUpdater::shared()->shutDown();
-    CellularHeartbeat::shared().shutDown();
   }
 
  private:
-  MobileAccount account() const { return {mobile_.homeDirectory(), mobile_.uid(), mobile_.gid()}; }
   PreparedFolder::Account storeAccount() const {
     const char* const home = mobile_.homeDirectory();
     return {home != nullptr ? home : "", mobile_.uid(), mobile_.gid()};
   }
 
   SystemQueues& queues_;
-  SystemRegions& regions_;
   MobileUser& mobile_;
 
   FilePreferences preferences_;
   LinuxFileManager files_;
-  PreferenceTransfer preferenceTransfer_{preferences_, regions_, [this](const char* path) {
-                                           return FileSystemManager(files_).readDictionary(path);
-                                         }};
-  PathPolicy policy_{[this] { return account(); }};
-  CarrierOperations carrier_{FileSystemManager::factory(files_), ZipArchiveCopier::factory(), policy_,
-                             preferences_, [this] { return account(); }};
   ModemManagerLogs radio_{queues_};
-  RadioLogging radioLogging_{radio_};
-
   CatalogueLabeler labeler_;
-  LabelRoutines labels_{labeler_, regions_};
+
   WorkerProgram storeWorker_{{.service = stores::kService,
                               .program = stores::kProgram,
                               .bootstrap = BRENVIK_BOOTSTRAP_DIRECTORY,
                               .folders = {}}};
   PreparedFolder contactsFolder_{[this] { return storeAccount(); }, "AddressBook", stores::kContactsFile};
   RemoteContacts contacts_{storeWorker_, contactsFolder_};
-  ChannelRemap channelRemap_{contacts_};
+  PreparedFolder voicemailFolder_{[this] { return storeAccount(); }, "Voicemail", stores::kVoicemailFile};
+  RemoteVoicemailStore voicemailStore_{storeWorker_, voicemailFolder_};
+  DynamicVisualVoicemail visualVoicemail_{BRENVIK_VISUAL_VOICEMAIL_LIBRARY, BRENVIK_VISUAL_VOICEMAIL_SYMBOL};
 
   WorkerProgram networkWorker_{{.service = kNetworkWorkerService,
                                 .program = BRENVIK_NETWORK_WORKER,
@@ -158,77 +142,8 @@ class Serving {
   RemoteGunzip gunzip_{networkWorker_};
   ChannelMessagePorts messagePorts_{BRENVIK_BOOTSTRAP_DIRECTORY};
   RemoteEchoNetwork echoNetwork_{networkWorker_};
-
-  PreparedFolder voicemailFolder_{[this] { return storeAccount(); }, "Voicemail", stores::kVoicemailFile};
-  RemoteVoicemailStore voicemailStore_{storeWorker_, voicemailFolder_};
-  DynamicVisualVoicemail visualVoicemail_{BRENVIK_VISUAL_VOICEMAIL_LIBRARY, BRENVIK_VISUAL_VOICEMAIL_SYMBOL};
-  VoicemailOperations voicemail_{voicemailStore_, visualVoicemail_};
-
   RemoteGeoService geoService_{networkAnswers_, {.configuration = BRENVIK_COUNTRY_CONFIGURATION}};
   ChannelTelephonyDaemon telephonyDaemon_{BRENVIK_BOOTSTRAP_DIRECTORY};
-  LocationRoutines location_{queues_, geoService_, telephonyDaemon_, GeoRequestState::shared()};
-
-  RequestAreas areas_{PortServerRegistry::shared(),
-                      preferenceTransfer_,
-                      carrier_,
-                      voicemail_,
-                      location_,
-                      radioLogging_,
-                      labels_,
-                      channelRemap_,
-                      *LASDUpdater::shared(),
-                      CellularHeartbeat::shared()};
-};
-
-// What the process tells about itself: at its status socket, and to the service manager in one line. Both
-// come after the first reply, for which somebody waits.
-class Telling {
- public:
-  // Processes that work for this one, and whether each runs at this moment; main loop only.
-  using Workers = std::function<std::vector<StatusReport::Worker>()>;
-
-  Telling(SystemPortSpace& ports, RunLoop& loop, WorkQueues& queues, Workers workers = {})
-      : ports_(ports), loop_(loop), queues_(queues), workers_(std::move(workers)) {}
-
-  // While a server serves. Without memory for it the helper serves all the same, and tells nothing.
-  void begin(ServerContext& server) try {
-    status_ = std::make_unique<HelperStatus>(HelperStatus::Sources{.server = server,
-                                                                   .lasd = *LASDUpdater::shared(),
-                                                                   .heartbeat = CellularHeartbeat::shared(),
-                                                                   .location = GeoRequestState::shared(),
-                                                                   .version = kVersion,
-                                                                   .socket = serviceSocket_,
-                                                                   .workers = workers_});
-    // The loop looks at its descriptors first: a client that has started this process gets its reply before
-    // this.
-    queues_.main().post([this] {
-      if (status_ == nullptr) return;
-      socket_ = StatusSocket::make(ports_, loop_, serviceSocket_,
-                                   [this] { return writeStatus(status_->report()); });
-    });
-    line_.changed();
-  } catch (const std::bad_alloc&) {
-    end();
-  }
-  void end() noexcept {
-    socket_.reset();
-    status_.reset();
-  }
-  // Any thread.
-  void changed() noexcept { line_.changed(); }
-
- private:
-  const std::string serviceSocket_ = std::string(BRENVIK_BOOTSTRAP_DIRECTORY "/") + kServiceName;
-
-  SystemPortSpace& ports_;
-  RunLoop& loop_;
-  WorkQueues& queues_;
-  const Workers workers_;
-  std::unique_ptr<HelperStatus> status_;
-  std::unique_ptr<StatusSocket> socket_;
-  NotifySocket serviceManager_;
-  StatusLine line_{queues_, serviceManager_,
-                   [this] { return status_ != nullptr ? status_->line() : std::string("Leaves"); }};
 };
 
 int run() {
@@ -249,44 +164,37 @@ int run() {
                               .isOnlyService = true});
   RemoteCallerReader callerReader(callerWorker);
   EntitlementFiles security(accounts, &callerReader);
-  EntitlementCheck entitlements(security, queues);
 
   SystemPortSpace ports;
   SystemRegions regions;
   SystemPortSources sources(ports, regions);
   SystemBootstrap bootstrap(ports, BRENVIK_BOOTSTRAP_DIRECTORY, BRENVIK_SERVICE_GROUP);
   LoadedBasebandLibrary baseband;
+  NotifySocket serviceManager;
 
-  std::unique_ptr<Serving> serving;
-  const RequestTable<> requests([&] {
-    serving = std::make_unique<Serving>(queues, regions, accounts);
-    return &serving->areas();
-  });
-  const auto describeCaller = [&entitlements](const AuditToken& caller) {
-    return entitlements.describe(caller);
-  };
-  Telling telling(ports, *loop, queues, [&serving] {
-    return serving != nullptr ? serving->workers()
-                              : std::vector<StatusReport::Worker>{{"network"}, {"stores"}};
-  });
-  const ServerPlatform platform{.ports = ports,
-                                .bootstrap = bootstrap,
-                                .sources = sources,
-                                .loop = *loop,
-                                .hasEntitlement =
-                                    [&entitlements](const char* entitlement, const AuditToken& caller) {
-                                      return entitlements.HasEntitlement(entitlement, caller);
-                                    },
-                                .idlePeriod = std::chrono::milliseconds(BRENVIK_IDLE_MILLISECONDS),
-                                .describeCaller = describeCaller,
-                                .onChange = [&telling] { telling.changed(); },
-                                .releaseMemory = [] { (void)::malloc_trim(0); }};
-  const auto endWork = [&telling, &serving] {
-    telling.end();
-    if (serving != nullptr) serving->shutDown();
-  };
-  return runHelper(baseband, platform, requests, endWork,
-                   [&telling](ServerContext& server) { telling.begin(server); });
+  const std::string serviceSocket = std::string(BRENVIK_BOOTSTRAP_DIRECTORY "/") + kServiceName;
+  const HelperPlatform platform{
+      .loop = *loop,
+      .queues = queues,
+      .accounts = accounts,
+      .security = security,
+      .ports = ports,
+      .regions = regions,
+      .sources = sources,
+      .bootstrap = bootstrap,
+      .baseband = baseband,
+      .serviceManager = serviceManager,
+      .makeRequestPlatform =
+          [&queues](MobileUser& mobile) { return std::make_unique<LinuxRequestPlatform>(queues, mobile); },
+      .serveStatus =
+          [&](std::function<std::string()> report) {
+            return std::shared_ptr<void>(StatusSocket::make(ports, *loop, serviceSocket, std::move(report)));
+          },
+      .version = kVersion,
+      .serviceSocket = serviceSocket,
+      .idlePeriod = std::chrono::milliseconds(BRENVIK_IDLE_MILLISECONDS),
+      .releaseMemory = [] { (void)::malloc_trim(0); }};
+  return runComposed(platform, HelperState::shared(accounts));
 }
 
 }  // namespace

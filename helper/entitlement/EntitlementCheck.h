@@ -19,6 +19,9 @@ namespace brenvik {
 // caller's process exits; a refusal is not remembered. Any thread.
 class EntitlementCheck {
  public:
+  // The time since some moment, by a clock that is never set.
+  static std::chrono::nanoseconds steadyTime();
+
   // `security` and `queues` must outlive the last call of HasEntitlement. `queues` watches the processes for
   // their exit; watching ends with this object. `now` is any clock that only moves forward; it limits how
   // often refusals are logged.
@@ -43,7 +46,6 @@ class EntitlementCheck {
 
  private:
   struct State;
-  static std::chrono::nanoseconds steadyTime();
   void remember(std::string_view name, const AuditToken& caller, std::shared_ptr<const LogCaller> described);
 
   TaskSecurity& security_;

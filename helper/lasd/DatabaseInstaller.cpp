@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
 
 #include "helper/lasd/DatabaseTypes.h"
 #include "platform/base/UniqueFd.h"
@@ -53,6 +54,8 @@ bool DatabaseInstaller::makeDirectory() {
   // another account's, which could put a link to anything there.
   if (const UniqueFd made = openDirectory(parts_.directory, O_NOFOLLOW); made.isValid())
     (void)::fchmod(made.get(), kDirectoryMode);
+  // Or a power cut could take the folder with the database in it, and leave the record of it.
+  syncDirectory(std::filesystem::path(parts_.directory).parent_path().string());
   return true;
 }
 

@@ -247,8 +247,17 @@ TEST_F(DatabaseInstallerTest, AFailedRenameSaysWhyAndKeepsTheTemporaryFile) {
   EXPECT_FALSE(recorded("gsm"));
 }
 
+TEST_F(DatabaseInstallerTest, AFolderThatIsMadeIsOnTheDiskBeforeTheDatabaseAndItsRecord) {
+  serveGzip(kUrl, "database");
+  SyncRecord syncs;
+  EXPECT_TRUE(install());
+  ASSERT_FALSE(syncs.synced.empty());
+  EXPECT_EQ(syncs.synced.front(), directory.parent_path().string());
+}
+
 TEST_F(DatabaseInstallerTest, TheWholeFileIsOnTheDiskBeforeItIsMovedInAndTheFolderBeforeTheRecordIsWritten) {
   serveGzip(kUrl, "database");
+  std::filesystem::create_directory(directory);
   SyncRecord syncs;
   std::vector<std::string> there;
   syncs.look = [&] {

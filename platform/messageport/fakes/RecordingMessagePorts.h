@@ -28,6 +28,11 @@ class RecordingMessagePorts final : public MessagePorts {
     return messages_;
   }
 
+  std::size_t count() const {
+    const std::lock_guard lock(mutex_);
+    return messages_.size();
+  }
+
   std::unique_ptr<RemoteMessagePort> openRemote(const std::string& name) noexcept override try {
     if (nobodyListens) return nullptr;
     return std::make_unique<Port>(*this, name);

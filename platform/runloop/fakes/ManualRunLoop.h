@@ -27,12 +27,7 @@ class ManualClock {
   // Moves time on, running what comes due at its own moment, in order of time, then of scheduling.
   void advance(Time by) {
     const Time end = now_ + by;
-    while (!due_.empty() && due_.begin()->first.first <= end) {
-      now_ = std::max(now_, due_.begin()->first.first);
-      auto action = std::move(due_.begin()->second);
-      due_.erase(due_.begin());
-      action();
-    }
+    for (auto due = next(); due && *due <= end; due = next()) (void)runNext();
     now_ = end;
   }
 
@@ -44,6 +39,19 @@ class ManualClock {
   }
   void cancel(const std::pair<Time, std::uint64_t>& id) { due_.erase(id); }
   std::size_t scheduled() const noexcept { return due_.size(); }
+  // When the next action comes due; none if nothing is scheduled.
+  std::optional<Time> next() const {
+    return due_.empty() ? std::nullopt : std::optional(due_.begin()->first.first);
+  }
+  // Moves time on to the next action and runs that one alone; false if nothing is scheduled.
+  bool runNext() {
+    if (due_.empty()) return false;
+    now_ = std::max(now_, due_.begin()->first.first);
+    auto action = std::move(due_.begin()->second);
+    due_.erase(due_.begin());
+    action();
+    return true;
+  }
 
  private:
   Time now_{0};
@@ -145,7 +153,9 @@ class ManualWorkQueue::ManualTimer final : public WorkQueue::Timer {
       if (interval_.count() > 0) {
         arm(interval_);
       }
-      queue_.post([handler = handler_, alive = std::weak_ptr<void>(alive_)] {
+      if (std::exchange(*isWaiting_, true)) return;  // ticks that could not run yet become one
+      queue_.post([handler = handler_, isWaiting = isWaiting_, alive = std::weak_ptr<void>(alive_)] {
+        *isWaiting = false;
         if (!alive.expired()) (*handler)();
       });
     });
@@ -154,6 +164,7 @@ class ManualWorkQueue::ManualTimer final : public WorkQueue::Timer {
   const std::chrono::nanoseconds first_;
   const std::chrono::nanoseconds interval_;
   const std::shared_ptr<Task> handler_;
+  const std::shared_ptr<bool> isWaiting_ = std::make_shared<bool>(false);  // a tick is posted
   std::shared_ptr<void> alive_ = std::make_shared<int>(0);
   std::pair<ManualClock::Time, std::uint64_t> id_;
   bool active_ = false;

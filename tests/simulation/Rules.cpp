@@ -1,0 +1,1204 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#include "Rules.h"
+
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <array>
+#include <cctype>
+#include <cerrno>
+#include <cstring>
+#include <span>
+
+#include "platform/plist/PropertyListCodec.h"
+
+namespace brenvik::simulation {
+namespace {
+
+using namespace std::chrono_literals;
+
+constexpr Time kIdle = 10s;
+constexpr Time kGeoPatience = 5s;
+const std::string kMain = "main";
+const std::string kMainTasks = "main tasks";
+const std::string kGeo = "GEO callback queue";
+const std::string kUpdater = "LASDUpdater";
+const std::string kHome = "/var/mobile";
+const std::string kHomeBundles = kHome + "/Library/Carrier Bundles/";
+const std::string kFixedBundles = "/private/var/mobile/Library/Carrier Bundles";
+const std::string kCrashLogs = kHome + "/Library/Logs/CrashReporter/";
+const std::string kDatabases = kHome + "/Library/LASD";
+constexpr uid_t kMobile = 501;
+constexpr std::array kOrder{8, 1, 2, 4, 16};
+
+const char* nameOfType(int type) {
+  switch (type) {
+    case 1:
+      return "umts";
+    case 2:
+      return "cdma";
+    case 4:
+      return "lte";
+    case 8:
+      return "gsm";
+    default:
+      return "scdma";
+  }
+}
+
+std::vector<std::string> listedPaths() {
+  std::vector<std::string> paths;
+  for (const std::string& home : {kHome, std::string("/private/var/mobile")}) {
+    for (const char* domain : {"carrier", "carrier_1", "carrier_2", "operator", "operator_1", "operator_2",
+                               "carrier.default", "carrier.bootstrap"}) {
+      paths.push_back(home + "/Library/Preferences/com.norvale." + domain + ".plist");
+    }
+    for (const char* bundle : {"Carrier Bundle", "Carrier1Bundle", "Carrier2Bundle", "Operator Bundle",
+                               "Operator1Bundle", "Operator2Bundle", "CarrierDefault", "CarrierBootstrap"}) {
+      paths.push_back(home + "/Library/" + bundle + ".bundle");
+    }
+  }
+  return paths;
+}
+
+std::string parentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
+std::string nameOf(std::string path) {
+  while (path.size() > 1 && path.back() == '/') path.pop_back();
+  return path.substr(path.rfind('/') + 1);
+}
+bool isHidden(const std::string& path) {
+  return path.starts_with("/root") || path.find("/.brenvik-") != std::string::npos;
+}
+
+// Equal in the sense of the version check: letters without their case, runs of digits by their value.
+bool sameVersion(std::string_view a, std::string_view b) {
+  std::size_t i = 0;
+  std::size_t j = 0;
+  const auto isDigit = [](char c) { return c >= '0' && c <= '9'; };
+  while (i < a.size() && j < b.size()) {
+    if (isDigit(a[i]) && isDigit(b[j])) {
+      unsigned long x = 0;
+      unsigned long y = 0;
+      for (; i < a.size() && isDigit(a[i]); ++i) x = x * 10 + static_cast<unsigned long>(a[i] - '0');
+      for (; j < b.size() && isDigit(b[j]); ++j) y = y * 10 + static_cast<unsigned long>(b[j] - '0');
+      if (x != y) return false;
+    } else if (std::tolower(a[i++]) != std::tolower(b[j++])) {
+      return false;
+    }
+  }
+  return i == a.size() && j == b.size();
+}
+
+PropertyList parsed(const std::string& bytes) { return parsePropertyList(std::as_bytes(std::span(bytes))); }
+
+std::string described(const Line& line) {
+  return std::string(line.isBsd ? "bsd/" : "unified/") + std::to_string(line.level) + " \"" + line.text +
+         "\"";
+}
+
+Expected status(KernelReturn code) { return {{code}, {}, {}, {}}; }
+Expected flagged(bool flag) { return {{0}, flag, {}, {}}; }
+
+}  // namespace
+
+std::string cut(const std::string& field, std::size_t size, bool isTerminated) {
+  std::string text = field.substr(0, isTerminated ? size - 1 : size);
+  text.resize(std::min(text.size(), std::strlen(text.c_str())));
+  return text;
+}
+
+bool isUtf8(const std::string& text) {
+  for (std::size_t i = 0; i < text.size();) {
+    const auto at = [&](std::size_t k) { return static_cast<unsigned char>(text[k]); };
+    const unsigned char first = at(i);
+    const std::size_t more = first < 0x80       ? 0
+                             : first >> 5 == 6  ? 1
+                             : first >> 4 == 14 ? 2
+                             : first >> 3 == 30 ? 3
+                                                : 9;
+    if (more == 9 || i + more >= text.size() + (more == 0 ? 1 : 0)) return false;
+    unsigned code = more == 0 ? first : first & (0x3FU >> more);
+    for (std::size_t k = 1; k <= more; ++k) {
+      if (at(i + k) >> 6 != 2) return false;
+      code = code << 6U | (at(i + k) & 0x3FU);
+    }
+    constexpr std::array<unsigned, 4> least{0, 0x80, 0x800, 0x10000};
+    if (code < least[more] || code > 0x10FFFF || (code >= 0xD800 && code < 0xE000)) return false;
+    i += more + 1;
+  }
+  return true;
+}
+
+Rules::Rules(World& world, const Surroundings& around, Tree files)
+    : world_(world), around_(around), files_(std::move(files)) {}
+
+// ---- what is seen ----
+
+void Rules::expect(const std::string& actor, Line line) { lines_[actor].push_back(std::move(line)); }
+
+void Rules::logs(const std::string& actorName, bool isBsd, int level, std::string text) {
+  if (world_.isKilled() || isUnsure) return;
+  timePasses();
+  const std::string actor = actorName == "com.norvale.httpdownloadqueue" ? kUpdater : actorName;
+  if (text.ends_with('\n')) text.pop_back();
+  if (text.starts_with("refused ")) return;
+  std::deque<Line>& waiting = lines_[actor];
+  const Line line{isBsd, level, text};
+  if (waiting.empty()) return breach("on " + actor + ", a line that nothing asks for: " + described(line));
+  const Line wanted = waiting.front();
+  waiting.pop_front();
+  const bool isRight = wanted.isBsd == isBsd && wanted.level == level &&
+                       (wanted.isBeginning ? text.starts_with(wanted.text) : text == wanted.text);
+  if (wanted.isBeginning) lastBeginning_ = text;
+  if (!isRight) {
+    breach("on " + actor + ", the line " + described(line) + " instead of " + described(wanted));
+  }
+}
+
+void Rules::pushes(const std::string& what, const std::vector<std::optional<std::string>>& values) {
+  timePasses();
+  std::vector<std::optional<std::string>> push{what};
+  push.insert(push.end(), values.begin(), values.end());
+  const auto shown = [](const auto& texts) {
+    std::string all;
+    for (const auto& each : texts) all += " [" + each.value_or("(absent)") + "]";
+    return all;
+  };
+  if (pushes_.empty()) return breach("a push that nothing asks for:" + shown(push));
+  if (pushes_.front() != push) breach("the push" + shown(push) + " instead of" + shown(pushes_.front()));
+  pushes_.pop_front();
+}
+
+void Rules::notifies(const PropertyList& notification) {
+  const std::string name(notification.find("Notification").asString().value_or("(none)"));
+  const std::string type(notification.find("DBType").asString().value_or(""));
+  if (notifications_.empty()) return breach("a notification that nothing asks for: " + name + " " + type);
+  if (notifications_.front() != std::pair(name, type)) {
+    breach("the notification " + name + " " + type + " instead of " + notifications_.front().first + " " +
+           notifications_.front().second);
+  }
+  notifications_.pop_front();
+}
+
+void Rules::settles() {
+  timePasses();
+  resolveHeartbeat();
+  if (!world_.isKilled()) isAnswered();
+  for (const auto& [actor, waiting] : lines_) {
+    if (!waiting.empty()) {
+      breach("on " + actor + ", a line that never came: " + described(waiting.front()));
+    }
+  }
+  if (!pushes_.empty()) breach("a push that never came: " + pushes_.front()[0].value_or(""));
+  if (!notifications_.empty()) breach("a notification that never came: " + notifications_.front().first);
+}
+
+std::string Rules::state() const {
+  std::string text = std::to_string(clients_.size()) + " clients, " + std::to_string(tokens_) + " tokens";
+  if (idle_) text += ", tick at " + std::to_string(idle_->latest.count());
+  return text;
+}
+
+// ---- lives, and the idle rule ----
+
+void Rules::begins() {
+  isRunning_ = true;
+  lines_.clear();
+}
+
+void Rules::exits(int status) {
+  if (status != 0) return breach("the helper left with status " + std::to_string(status));
+  const Time now = world_.now();
+  if (!idle_) {
+    breach("the helper left while it was not idle: " + state());
+  } else if (now < idle_->earliest || now > idle_->latest) {
+    breach("the helper left at " + std::to_string(now.count()) + " and not at " +
+           std::to_string(idle_->latest.count()));
+  } else if (around_.hostsBaseband && around_.basebandIsBusy) {
+    breach("the helper left while the baseband server was busy");
+  }
+  if (!clients_.empty()) breach("the helper left its clients");
+  settles();
+  wasKilled();
+  undo_.reset();
+}
+
+void Rules::wasKilled() {
+  isRunning_ = false;
+  lines_.clear();
+  pushes_.clear();
+  notifications_.clear();
+  granted_.clear();
+  clients_.clear();
+  tokens_ = 0;
+  idle_.reset();
+  isAwaiting_ = false;
+  timeOuts_.clear();
+  checks_.clear();
+  toUpdate_.clear();
+  expectedUrl_.clear();
+  heldHeartbeat_ = 0;
+  heartbeats_.clear();
+}
+
+void Rules::idleSince(Time earliest, Time latest) {
+  if (tokens_ > 0 || !clients_.empty() || !isRunning_) return;
+  if (!idle_) idle_ = Idle{earliest + kIdle, latest + kIdle};
+}
+
+void Rules::takeToken() {
+  ++tokens_;
+  cancelIdle();
+}
+
+void Rules::giveToken(Time earliest, Time latest) {
+  --tokens_;
+  idleSince(earliest, latest);
+}
+
+void Rules::timePasses() {
+  const Time now = world_.now();
+  while (!timeOuts_.empty() && timeOuts_.front().first <= now) {
+    const bool isCivic = timeOuts_.front().second;
+    timeOuts_.pop_front();
+    if (!isAwaiting_) continue;
+    isAwaiting_ = false;
+    if (isCivic) {
+      pushCivic({countryCode(kMainTasks), "", "", ""});
+    } else {
+      pushAddress("");
+    }
+  }
+  if (!heartbeats_.empty() && now > heartbeats_.front().first) resolveHeartbeat();
+  while (isRunning_ && idle_ && now > idle_->latest) {
+    if (!around_.hostsBaseband || !around_.basebandIsBusy) {
+      breach("the helper should have left at " + std::to_string(idle_->latest.count()));
+      return;
+    }
+    idle_->earliest += kIdle;
+    idle_->latest += kIdle;
+  }
+}
+
+// ---- check-in ----
+
+std::vector<KernelReturn> Rules::codesOfCheckIn(std::pair<pid_t, std::uint32_t> process, bool isAlive,
+                                                bool mayCheckIn, bool portIsDead) {
+  const bool isKnown = granted_.contains(process);
+  if (!isKnown && !(isAlive && mayCheckIn)) {
+    // One that has just died may still be remembered.
+    return isAlive || !portIsDead ? std::vector{35} : std::vector{35, 5};
+  }
+  if (around_.outOfDescriptors || portIsDead) return {5};
+  return {0};
+}
+
+void Rules::checkedIn(std::pair<pid_t, std::uint32_t> process, int connection, KernelReturn code) {
+  if (code == 35) return;
+  granted_.insert(process);
+  if (code == 0) {
+    clients_.insert(connection);
+    cancelIdle();
+  } else if (!around_.outOfDescriptors) {
+    // The port was dead: the countdown began anew when that was noticed.
+    cancelIdle();
+    idleSince(world_.now(), world_.now());
+  }
+}
+
+void Rules::portDies(int connection) {
+  if (clients_.erase(connection) > 0) idleSince(world_.now(), world_.now());
+}
+
+// ---- requests ----
+
+Expected Rules::before(const Call& call) {
+  switch (call.form) {
+    case Call::Form::right:
+      break;
+    case Call::Form::unknownId:
+      return status(-303);
+    case Call::Form::wrongLength:
+    case Call::Form::wrongType:
+      return status(-300);
+    default:
+      return status(-304);
+  }
+  if (call.row >= 9 && call.row <= 17) filesBefore_ = files_;
+  switch (call.row) {
+    case 6:
+      return setPreference(call);
+    case 7:
+      return copyPreference(call, "mhs1");
+    case 8:
+      return copyPreference(call, "mhs2");
+    case 9:
+      return replaceLink(call);
+    case 10:
+      return createLink(call);
+    case 11:
+      return removeFile(call);
+    case 13:
+      return heartbeat(call);
+    case 14:
+      return checkDatabases(call);
+    case 15:
+      return copyFile(call);
+    case 16:
+      return copyCrashLogs(call);
+    case 17:
+      return moveBundle(call);
+    case 18:
+      bsdError(kMain, "server_BVMobileHelperRequestCountryCodeFromLocation ");
+      if (call.latitude == 0 && call.longitude == 0) pushCivic({countryCode(kMainTasks), "", "", ""});
+      return status(0);
+    case 19: {
+      Expected expected = status(0);
+      expected.text = countryCode(kMain).substr(0, 64);
+      return expected;
+    }
+    case 20:
+      expect(kMain, {false, 7, "server_BVMobileHelperRequestWanIPFromLocation"});
+      return status(0);
+    case 21:
+      bsdError(kMain, "Enabling wireless radio manager logs: " + std::to_string(call.value));
+      return status(0);
+    case 22:
+      if (around_.archiveFatal) bsdError(kMain, "ArkCopier signaled fatal file error");
+      return flagged(around_.archiveResult == 0);
+    case 23:
+      return loadPlist(call);
+    case 24:
+      return labels(call, true);
+    case 25:
+      return labels(call, false);
+    case 26:
+      return remap(call);
+    default:
+      return voicemail(call);
+  }
+}
+
+Expected Rules::voicemail(const Call& call) {
+  std::vector<std::string> texts;
+  for (const std::string& each : call.texts) texts.push_back(cut(each, 256, true));
+  for (const std::string& each : texts) {
+    if (!isUtf8(each)) return status(5);
+  }
+  Expected expected = status(0);
+  switch (call.row) {
+    case 0:
+      token_ = texts[0];
+      break;
+    case 1:
+      tokens2_[texts[0]] = texts[1];
+      break;
+    case 2:
+      token_.reset();
+      break;
+    case 3:
+      token_.reset();
+      tokens2_.clear();
+      break;
+    case 4: {
+      const auto found = tokens2_.find(texts[0]);
+      expected.text = found != tokens2_.end() ? found->second : "";
+      break;
+    }
+    case 5:
+      expected.text = token_.value_or("");
+      break;
+    default:
+      expected.flag = around_.isSubscribed;
+  }
+  return expected;
+}
+
+// ---- preferences ----
+
+namespace {
+
+bool namesAFile(const std::string& domain) {
+  return !domain.empty() && domain != "." && domain != ".." && domain.find('/') == std::string::npos;
+}
+
+}  // namespace
+
+Expected Rules::setPreference(const Call& call) {
+  const std::string domain = cut(call.texts[0], 256, true);
+  const std::string key = cut(call.texts[1], 256, true);
+  if (!isUtf8(domain) || !isUtf8(key)) return status(5);
+  PropertyList value;
+  if (call.regions[0].size() != 1) {
+    value = parsed(call.regions[0]);
+    if (!value) return status(5);
+  }
+  if (!namesAFile(domain)) {
+    expect(kMain, {false, 3, "Preferences", true});
+    return status(0);
+  }
+  Domain& there = domains_[domain];
+  there.mayHaveFile = true;
+  Values& values = there.keys[key];
+  if (values.empty()) values.emplace_back();
+  Values both = values;
+  both.push_back(value);
+  undo_ = [this, domain, key, both] { domains_[domain].keys[key] = both; };
+  values = {value};
+  return status(0);
+}
+
+Expected Rules::copyPreference(const Call& call, const char* which) {
+  const std::string domain = cut(call.texts[0], 256, true);
+  const std::string key = cut(call.texts[1], 256, true);
+  if (!isUtf8(domain) || !isUtf8(key)) return status(5);
+  Expected expected = status(0);
+  Values values{PropertyList()};
+  if (const auto there = domains_.find(domain); namesAFile(domain) && there != domains_.end()) {
+    if (const auto found = there->second.keys.find(key); found != there->second.keys.end()) {
+      values = found->second;
+    }
+  }
+  expected.isRightPayload = [this, values, domain, key, which](const std::string& payload) {
+    const PropertyList value = payload.empty() ? PropertyList() : parsed(payload);
+    if (payload.empty() ? std::none_of(values.begin(), values.end(), [](const auto& each) { return !each; })
+                        : std::find(values.begin(), values.end(), value) == values.end() ||
+                              !payload.starts_with("<?xml")) {
+      return false;
+    }
+    // Now it is known which of them it is.
+    if (values.size() > 1) domains_[domain].keys[key] = {value};
+    std::deque<Line>& waiting = lines_[kMain];
+    if (payload.empty() && !waiting.empty()) waiting.pop_front();
+    return payload.empty() ||
+           lastBeginning_ == "VM_ALLOCATE " + std::to_string(payload.size()) + "l (" + which + ")";
+  };
+  const bool isThere = std::any_of(values.begin(), values.end(), [](const auto& each) { return !!each; });
+  if (isThere) expect(kMain, {true, 3, "VM_ALLOCATE ", true});
+  return expected;
+}
+
+Expected Rules::loadPlist(const Call& call) {
+  const std::string path = cut(call.texts[0], 256, true);
+  info(kMain, "Loading " + path + " as plist");
+  const std::string folder = "/root/Library/Preferences/";
+  Expected expected = status(0);
+  if (path.starts_with(folder) && path.ends_with(".plist")) {
+    const std::string domain = path.substr(folder.size(), path.size() - folder.size() - 6);
+    const auto there = domains_.find(domain);
+    if (there != domains_.end() && there->second.mayHaveFile) {
+      bool mayLack = true;  // without values there need not be a file
+      for (const auto& [key, values] : there->second.keys) {
+        mayLack =
+            mayLack && std::any_of(values.begin(), values.end(), [](const auto& each) { return !each; });
+      }
+      if (mayLack) {
+        expected.codes = {0, 9};
+        expect(kMain, {false, 3, "Could not create data representation of dictionary", false});
+      }
+      expected.isRightPayload = [this, keys = there->second.keys, mayLack](const std::string& payload) {
+        if (mayLack && !lines_[kMain].empty()) lines_[kMain].pop_front();
+        const PropertyList all = parsed(payload);
+        if (!all.is(PropertyList::Type::dictionary)) return false;
+        std::size_t found = 0;
+        for (const auto& [key, values] : keys) {
+          const PropertyList value = all.find(key);
+          if (std::find(values.begin(), values.end(), value) == values.end()) return false;
+          if (value) ++found;
+        }
+        return found == all.size();
+      };
+      return expected;
+    }
+  } else if (const auto found = files_.find(path); found != files_.end() && S_ISREG(found->second.mode)) {
+    const PropertyList value = parsed(found->second.content);
+    if (value.is(PropertyList::Type::dictionary)) {
+      expected.isRightPayload = [value](const std::string& payload) { return parsed(payload) == value; };
+      return expected;
+    }
+  }
+  error(kMain, "Could not create data representation of dictionary");
+  return status(9);
+}
+
+// ---- carrier files ----
+
+bool Rules::exists(const std::string& path, bool* isDirectory) const {
+  std::string at = path;
+  while (at.size() > 1 && at.back() == '/') at.pop_back();
+  for (int links = 0; links < 8; ++links) {
+    const auto found = files_.find(at);
+    if (found == files_.end()) return false;
+    if (S_ISLNK(found->second.mode)) {
+      at = found->second.content;
+      continue;
+    }
+    if (isDirectory != nullptr) *isDirectory = S_ISDIR(found->second.mode);
+    return true;
+  }
+  return false;
+}
+
+bool Rules::hasBelow(const std::string& folder) const {
+  const auto next = files_.upper_bound(folder + "/");
+  return next != files_.end() && next->first.starts_with(folder + "/");
+}
+
+bool Rules::makeFolders(const std::string& path) {
+  bool isDirectory = false;
+  if (exists(path, &isDirectory)) return isDirectory;
+  if (files_.contains(path)) return false;  // a link to nothing
+  const std::string parent = parentOf(path);
+  if (!parent.empty() && !makeFolders(parent)) return false;
+  files_[path] = {S_IFDIR | 0755, {}, 0, 0};
+  return true;
+}
+
+bool Rules::isListed(const std::string& path) {
+  const auto found = files_.find(path);
+  if (found != files_.end() && (found->second.mode & 0xA000) == 0) return false;
+  const auto all = listedPaths();
+  if (std::find(all.begin(), all.end(), path) == all.end()) return false;
+  info(kMain, path + " is within allowed path " + path);
+  return true;
+}
+
+bool Rules::isAllowed(const std::string& path) {
+  for (const std::string& folder : {kHomeBundles, kFixedBundles}) {
+    if (path.starts_with(folder)) {
+      info(kMain, "Allowing path " + path + " within " + folder);
+      return true;
+    }
+  }
+  if (isListed(path)) return true;
+  error(kMain, "NOT Allowing path " + path + " as it isn't within the wild card directories:");
+  error(kMain, kHomeBundles);
+  error(kMain, kFixedBundles);
+  const auto extension = path.find(".tcpk");
+  return path.starts_with("/tmp") && extension != std::string::npos && extension + 5 == path.size();
+}
+
+bool Rules::placeLink(const std::string& path, const std::string& target) {
+  bool isDirectory = false;
+  if (!exists(parentOf(path), &isDirectory) || !isDirectory) return false;
+  const auto found = files_.find(path);
+  if (found != files_.end() && S_ISDIR(found->second.mode) && hasBelow(path)) return false;
+  files_[path] = {S_IFLNK | 0777, target, 0, 0};
+  return true;
+}
+
+Expected Rules::createLink(const Call& call) {
+  return status(placeLink(cut(call.texts[1], 1024, true), cut(call.texts[0], 1024, true)) ? 0 : 5);
+}
+
+Expected Rules::replaceLink(const Call& call) {
+  const std::string path = cut(call.texts[1], 1024, true);
+  if (!isListed(path)) {
+    error(kMain, "Cannot remove symlink: " + path);
+    return status(8);
+  }
+  if (!placeLink(path, cut(call.texts[0], 1024, true))) return status(5);
+  info(kMain, "linkpath: " + path + ", domain: " + cut(call.texts[2], 1024, true));
+  return status(0);
+}
+
+Expected Rules::removeFile(const Call& call) {
+  const std::string path = cut(call.texts[0], 1024, true);
+  const std::string domain = cut(call.texts[1], 1024, true);
+  if (!domain.empty()) bsdNotice(kMain, "Removing domain: " + domain);
+  if (!isAllowed(path)) return status(8);
+  const auto found = files_.find(path);
+  if (found == files_.end() || (S_ISDIR(found->second.mode) && hasBelow(path))) return status(5);
+  files_.erase(found);
+  return status(0);
+}
+
+Expected Rules::copyFile(const Call& call) {
+  const std::string from = cut(call.texts[0], 256, true);
+  const std::string to = cut(call.texts[1], 256, true);
+  const std::string name = cut(call.texts[2], 256, true);
+  const std::string source = from + "/" + name;
+  const std::string destination = to + "/" + name;
+  bsdNotice(kMain, "'" + from + "', '" + to + "', '" + name + "'");
+  if (!isAllowed(destination)) {
+    bsdError(kMain, "Destination directory " + destination + " is not within the allowed directories");
+    return flagged(false);
+  }
+  const auto fails = [&] {
+    bsdError(kMain, "Failed to copy the file " + from + " to " + to);
+    return flagged(false);
+  };
+  if (!exists(to) && !makeFolders(to)) return fails();
+  if (!exists(source)) return fails();
+  const bool isThere = exists(destination);
+  if (!isThere && files_.contains(destination)) return fails();  // a link to nothing is in the way
+  files_[source].uid = files_[source].gid = 0;
+  Item copy = files_[source];
+  copy.uid = copy.gid = kMobile;
+  files_[destination] = copy;
+  return flagged(true);
+}
+
+// Everything below a folder, to a folder that is not there.
+void Rules::copyBelow(const std::string& from, const std::string& to, bool move) {
+  Tree copies;
+  for (auto each = files_.lower_bound(from); each != files_.end();) {
+    const std::string& path = each->first;
+    if (path != from && !path.starts_with(from + "/")) {
+      if (!path.starts_with(from)) break;
+      ++each;
+      continue;
+    }
+    copies[to + path.substr(from.size())] = each->second;
+    each = move ? files_.erase(each) : std::next(each);
+  }
+  files_.merge(copies);
+}
+
+Expected Rules::copyCrashLogs(const Call& call) {
+  const std::string source = cut(call.texts[0], 256, true);
+  bsdNotice(kMain, "'" + source + "', '" + kCrashLogs + "'");
+  bool isDirectory = false;
+  if (!exists(source, &isDirectory)) {
+    bsdNotice(kMain, "Failed to copy the directory " + source + " to " + kCrashLogs +
+                         ". Error: " + std::to_string(-1));
+    return flagged(false);
+  }
+  files_[source].uid = files_[source].gid = 0;
+  const std::string destination = kCrashLogs + nameOf(source);
+  bool isFolder = false;
+  const bool isThere = exists(destination, &isFolder);
+  unsureFiles_.insert(destination);
+  if (!isThere) {
+    copyBelow(source, destination, false);
+  } else if (!isDirectory) {
+    if (!isFolder) files_[destination] = files_[source];
+  } else if (!isFolder) {
+    files_.erase(destination);
+    copyBelow(source, destination, false);
+  } else {
+    Tree copies;
+    for (const auto& [path, item] : files_) {
+      if (path.starts_with(source + "/")) copies[destination + path.substr(source.size())] = item;
+    }
+    for (const auto& [path, item] : copies) files_[path] = item;
+  }
+  // An empty folder is removed, in copy mode as well, where the copy was a merge.
+  if (isDirectory && !hasBelow(source)) {
+    if (isThere) files_.erase(source);
+  }
+  return flagged(true);
+}
+
+Expected Rules::moveBundle(const Call& call) {
+  const std::string source = cut(call.texts[0], 256, true);
+  const std::string to = cut(call.texts[1], 256, true);
+  const std::string name = cut(call.texts[2], 256, true);
+  const std::string destination = to + "/" + name;
+  bsdNotice(kMain, "'" + source + "', '" + to + "'");
+  if (!exists(to) && !makeFolders(to)) {
+    expect(kMain, {true, 5, "Failed to create CarrierBundles Dir  to " + to + ". Error: ", true});
+    return flagged(false);
+  }
+  bsdNotice(kMain, "'" + source + "', '" + to + "', '" + name + "'");
+  if (!isAllowed(destination)) {
+    bsdError(kMain, "Destination directory " + destination + " is not within the allowed directories");
+    return flagged(false);
+  }
+  const auto fails = [&](int code) {
+    expect(kMain,
+           {true, 3,
+            "Failed to move the directory " + source + " to " + to + ". Error: " + std::to_string(code)});
+    return flagged(false);
+  };
+  if (!exists(source)) return fails(-1);
+  for (auto& [path, item] : files_) {
+    if (path == source || path.starts_with(source + "/")) item.uid = item.gid = 0;
+  }
+  if (files_.contains(destination)) return fails(EEXIST);
+  bool isDirectory = false;
+  if (!exists(to, &isDirectory) || !isDirectory) return fails(ENOTDIR);
+  copyBelow(source, destination, true);
+  return flagged(true);
+}
+
+// ---- labels and contacts ----
+
+namespace {
+
+std::optional<std::string> identifierOf(const std::string& key) {
+  constexpr std::array<std::pair<const char*, const char*>, 6> table{{{"PRIMARY", "primary"},
+                                                                      {"SECONDARY", "secondary"},
+                                                                      {"PERSONAL", "personal"},
+                                                                      {"BUSINESS", "business"},
+                                                                      {"TRAVEL", "travel"},
+                                                                      {"CELL_DATA", "data"}}};
+  for (const auto& [name, identifier] : table) {
+    if (key == std::string("USER_LABEL_") + name) {
+      return std::string("com.norvale.subscription-label.") + identifier;
+    }
+  }
+  return std::nullopt;
+}
+
+}  // namespace
+
+Expected Rules::labels(const Call& call, bool badges) {
+  const std::string who = badges ? "CopyBadgeLabels" : "CopyLocalizedLabels";
+  standard(kMain, who + (badges ? ", compiling badge labels." : ", compiling localized labels.") +
+                      " labels len:" + std::to_string(call.regions[0].size()) +
+                      ", languages len:" + std::to_string(call.regions[1].size()));
+  std::array<PropertyList, 2> arrays;
+  for (std::size_t i = 0; i < 2; ++i) {
+    const std::string field = i == 0 ? "labels" : "languages";
+    arrays[i] = parsed(call.regions[i]);
+    if (!arrays[i]) {
+      error(kMain, who + ", cannot build " + field + " from data");
+      return status(5);
+    }
+    if (!arrays[i].is(PropertyList::Type::array)) {
+      error(kMain, who + ", invalid type of '" + field + "' field");
+      return status(5);
+    }
+  }
+  std::vector<std::string> wanted;
+  bool expectsText = false;
+  for (std::size_t i = 0; i < arrays[0].size(); ++i) {
+    const auto text = arrays[0].at(i).asString();
+    if (!badges) {
+      if (!text) continue;
+      if (const auto found = identifierOf(std::string(*text))) wanted.push_back(*found);
+    } else if (expectsText) {
+      wanted.emplace_back(text.value_or("(not a text)"));
+      expectsText = false;
+    } else if (!text) {
+      error(kMain, "invalid object in array - ignore the rest");
+      break;
+    } else if (text->empty()) {
+      expectsText = true;
+    } else {
+      if (const auto found = identifierOf(std::string(*text))) wanted.push_back(*found);
+      ++i;
+    }
+  }
+  if (badges) {
+    if (wanted.empty()) {
+      error(kMain, "no labels given");
+      return status(5);
+    }
+    standard(kMain,
+             "getLocalizedBadgeLabelsForUnlocalizedLabels, " + std::to_string(wanted.size()) + " label(s)");
+  } else {
+    standard(kMain, "getLocalizedPredefinedLabels, " + std::to_string(arrays[0].size()) + " label(s), " +
+                        std::to_string(arrays[1].size()) + " language(s)");
+  }
+  // The labeler of this machine answers with what it was given, if that is a text.
+  std::erase(wanted, "(not a text)");
+  Expected expected = status(0);
+  expected.isRightPayload = [wanted](const std::string& payload) {
+    const PropertyList all = parsed(payload);
+    if (!all.is(PropertyList::Type::array) || all.size() != wanted.size()) return false;
+    for (std::size_t i = 0; i < wanted.size(); ++i) {
+      if (all.at(i).asString() != wanted[i]) return false;
+    }
+    return true;
+  };
+  return expected;
+}
+
+Expected Rules::remap(const Call& call) {
+  const std::string from = cut(call.texts[0], 64, false);
+  const std::string to = cut(call.texts[1], 64, false);
+  standard(kMain, "remapChannelIdentifier " + from + " -> " + to);
+  if (!around_.contactsAreReachable) {
+    error(kMain, "unable to create ContactsChannelManager");
+    return flagged(true);
+  }
+  std::optional<std::string> failure = around_.contactsError;
+  if (!isUtf8(from) || !isUtf8(to)) failure = "not UTF-8";
+  standard(kMain, std::string("remapChannelIdentifier result: ") + (failure ? "failure" : "success") + " : " +
+                      failure.value_or("(none)"));
+  return flagged(!failure);
+}
+
+// ---- location ----
+
+std::string Rules::countryCode(const std::string& actor) {
+  if (!around_.countryCode) bsdError(actor, "Didn't get valid country code from GeoService.");
+  return around_.countryCode.value_or("");
+}
+
+void Rules::pushCivic(const std::vector<std::string>& texts) {
+  if (around_.telephonyIsAbsent) {
+    return bsdError(kGeo, "sendCivicInfoToQV to Brenvik failed, could not open QVServerConnection");
+  }
+  std::vector<std::optional<std::string>> push{"civic"};
+  for (const std::string& each : texts) push.push_back(isUtf8(each) ? std::optional(each) : std::nullopt);
+  pushes_.push_back(push);
+  if (around_.telephonyError != 0) {
+    bsdNotice(kGeo, "sendCivicInfoToQV failed civic info to Brenvik due to error: " +
+                        std::to_string(around_.telephonyError));
+  } else {
+    bsdNotice(kGeo, "sendCivicInfoToQV sent civic info to Brenvik successfully");
+  }
+}
+
+void Rules::pushAddress(const std::string& address) {
+  if (around_.telephonyIsAbsent) {
+    return error(kGeo, "sendWanIPToQV to Brenvik failed, could not open QVServerConnection");
+  }
+  pushes_.push_back({"address", isUtf8(address) ? std::optional(address) : std::nullopt});
+  if (around_.telephonyError != 0) {
+    error(kGeo,
+          "sendWanIPToQV failed WAN IP to Brenvik due to error: " + std::to_string(around_.telephonyError));
+  } else {
+    standard(kGeo, "sendWanIPToQV sent WAN IP to Brenvik successfully");
+  }
+}
+
+void Rules::geoSubmitted(bool isCivic) {
+  timePasses();
+  isAwaiting_ = true;
+  timeOuts_.emplace_back(world_.now() + kGeoPatience, isCivic);
+}
+
+void Rules::geoAnswers(bool isCivic, const std::optional<MapItems>& items,
+                       const std::optional<std::string>& ip, const std::optional<std::string>& failure) {
+  timePasses();
+  const bool wasAwaited = std::exchange(isAwaiting_, false);
+  if (!isCivic) {
+    if (!wasAwaited) return standard(kGeo, "_RequestWanIPFromLocation wasn't waiting for response from GEO");
+    if (failure) {
+      error(kGeo, "_RequestWanIPFromLocation error: (" + *failure + ")");
+      return pushAddress("");
+    }
+    standard(kGeo, "_RequestWanIPFromLocation WAN IP: " + ip.value_or(""));
+    return pushAddress(ip.value_or(""));
+  }
+  const std::string who = "_RequestCivicInfoFromLatitudeLongitude ";
+  const std::string who2 = "_RequestCivicInfoLatitudeLongitude ";
+  if (!wasAwaited) return bsdError(kGeo, who + "wasn't waiting for response from GEO");
+  std::vector<std::string> found(4);
+  if (failure) bsdError(kGeo, who + "error: (" + *failure + ")");
+  if (failure || !items || items->empty()) {
+    bsdError(kGeo, who + "didn't get any mapItems");
+  } else {
+    bsdNotice(kGeo, who + "mapItems: (" + std::to_string(items->size()) + ")");
+    const auto& item = items->front();
+    if (!item || !item->valid) {
+      bsdError(kGeo, who2 + "NULL mapItem ");
+    } else if (!item->address || !item->address->structuredAddress) {
+      bsdError(kGeo, who2 + "mapItem didn't get a structured address");
+    } else {
+      const StructuredAddress& address = *item->address->structuredAddress;
+      const std::array parts{
+          std::pair("country code", &address.countryCode), std::pair("state", &address.administrativeArea),
+          std::pair("city", &address.locality), std::pair("postal code", &address.postCode)};
+      for (std::size_t i = 0; i < parts.size(); ++i) {
+        if (!*parts[i].second) continue;
+        bsdNotice(kGeo, who + parts[i].first + ": " + **parts[i].second);
+        found[i] = **parts[i].second;
+      }
+    }
+  }
+  if (found[0].empty()) found[0] = countryCode(kGeo);
+  pushCivic(found);
+}
+
+// ---- the heartbeat ----
+
+Expected Rules::heartbeat(const Call& call) {
+  heartbeats_.emplace_back(world_.now(), call.value != 0);
+  return status(0);
+}
+
+void Rules::resolveHeartbeat() {
+  while (!heartbeats_.empty()) {
+    const auto [since, isOn] = heartbeats_.front();
+    const Time now = world_.now();
+    // A command waits for the probe before it, and the start of one for its own.
+    if (!world_.isQuiet("com.norvale.otaheartbeat") &&
+        now - since < 5s * static_cast<int>(heartbeats_.size())) {
+      return;
+    }
+    heartbeats_.pop_front();
+    if (isOn) {
+      takeToken();
+      heldHeartbeat_ = 1;
+    } else if (std::exchange(heldHeartbeat_, 0) > 0) {
+      giveToken(since, now);
+    }
+  }
+}
+
+// ---- the databases ----
+
+Expected Rules::checkDatabases(const Call& call) {
+  std::array<char, 16> mask{};
+  std::snprintf(mask.data(), mask.size(), "%x", static_cast<unsigned>(call.value));
+  info(kMain, std::string("Trying to see if update available for mask ") + mask.data());
+  takeToken();
+  checks_.push_back(static_cast<std::uint32_t>(call.value));
+  if (checks_.size() == 1) beginCheck();
+  return status(0);
+}
+
+void Rules::beginCheck() {
+  info(kUpdater, "Reading local resource com.norvale.lasd");
+  expectedUrl_ = "https://lasd.norvale.example/1/v3/lasd.plist";
+  for (const int type : kOrder) {
+    if ((checks_.front() & static_cast<unsigned>(type)) == 0) continue;
+    PropertyList record;
+    const auto& keys = domains_["com.norvale.lasd"].keys;
+    if (const auto found = keys.find(nameOfType(type)); found != keys.end()) record = found->second.back();
+    local_[type] = record.is(PropertyList::Type::dictionary) ? record : PropertyList();
+  }
+  info(kUpdater, "Fetching URL " + expectedUrl_);
+}
+
+void Rules::endCheck() {
+  checks_.pop_front();
+  giveToken(world_.now(), world_.now());
+  if (!checks_.empty()) beginCheck();
+}
+
+void Rules::expectNotification(const std::string& name, const std::string& type) {
+  if (around_.lasdListens) notifications_.emplace_back("com.norvale.lasd." + name, type);
+}
+
+void Rules::webSends(const std::string& url) {
+  if (url != expectedUrl_) breach("a fetch of " + url + " instead of " + expectedUrl_);
+}
+
+void Rules::webAnswers(const std::string& url, const WebAnswer& answer) {
+  timePasses();
+  if (checks_.empty()) return breach("an answer without a check");
+  const bool isGood = !answer.isNothing && answer.kind == WebErrorKind::none && answer.status == 200;
+  if (answer.isNothing) {
+    error(kUpdater, "Did not receive HTTP response!");
+  } else if (isGood) {
+    info(kUpdater, "URL retrieved " + url + ", size: " + std::to_string(answer.body.size()) + " ");
+  } else {
+    expect(kUpdater, {false, 3, "HTTP request failed for URL " + url + " with error ", true});
+  }
+  const bool hasBody = isGood && !answer.body.empty();
+  if (!toUpdate_.empty()) {
+    databaseEnds(hasBody ? installs(url, answer) : [&] {
+      error(kUpdater, "Cannot download file " + url + ". Either Wifi is turned OFF or not Wifi attached");
+      return false;
+    }());
+    return;
+  }
+  if (!hasBody) {
+    error(kUpdater, "Could not fetch data from source " + url);
+    expectNotification("UpdateFailed", "");
+    return endCheck();
+  }
+  const Manifest& manifest = manifests[answer.body];
+  wanted_.clear();
+  if (!manifest.isDictionary) {
+    error(kUpdater, "Could not create version dictionary from downloaded plist!");
+  } else {
+    compareManifest(manifest);
+  }
+  if (wanted_.empty()) {
+    error(kUpdater, "No update required for any databases");
+    expectNotification("NoUpdateRequired", "");
+    return endCheck();
+  }
+  for (const int type : kOrder) {
+    if (wanted_.contains(type)) toUpdate_.push_back(type);
+  }
+  nextDatabase();
+}
+
+void Rules::compareManifest(const Manifest& manifest) {
+  wanted_.clear();
+  for (const int type : {1, 2, 4, 8, 16}) {
+    if ((checks_.front() & static_cast<unsigned>(type)) == 0) continue;
+    const std::string name = nameOfType(type);
+    const auto entry = manifest.entries.find(name);
+    if (entry == manifest.entries.end() || !entry->second.isDictionary) {
+      info(kUpdater, name + " db is not present locally, update required");
+      continue;
+    }
+    const auto& server = entry->second.version;
+    const PropertyList& record = local_[type];
+    const auto local = record.find("Version").asString();
+    if (!record || (!local && server)) {
+      info(kUpdater, "We have don't have a previously downloaded " + name + " database, server has " +
+                         server.value_or("(null)") + ", update required");
+    } else if (local && server && sameVersion(*local, *server)) {
+      info(kUpdater, name + " version " + std::string(*local) + " matches server version");
+      continue;
+    } else {
+      info(kUpdater, "We have " + name + " version " + std::string(local.value_or("(null)")) +
+                         ", server has " + server.value_or("(null)") + ", update required");
+    }
+    wanted_[type] = entry->second;
+  }
+}
+
+void Rules::nextDatabase() {
+  while (!toUpdate_.empty()) {
+    const int type = toUpdate_.front();
+    const std::string name = nameOfType(type);
+    const auto& url = wanted_[type].url;
+    if (!url || url->empty()) {
+      error(kUpdater,
+            !url ? "Could not find " + name + " database URL" : "URL for " + name + " database is empty");
+      toUpdate_.pop_front();
+      continue;
+    }
+    const auto folder = files_.find(kDatabases);
+    if (folder == files_.end()) {
+      filesBefore_ = files_;
+      files_[kDatabases] = {S_IFDIR | 0755, {}, 0, 0};
+    } else if (!S_ISDIR(folder->second.mode)) {
+      error(kUpdater, "Cannot create " + kDatabases + " errno set to File exists");
+      toUpdate_.pop_front();
+      expectNotification("UpdateFailed", "");
+      continue;
+    }
+    info(kUpdater, "Fetching URL " + *url);
+    if (!url->starts_with("https://")) {
+      error(kUpdater, "Cannot create HTTP request for URL " + *url);
+      error(kUpdater, "Cannot download file " + *url + ". Either Wifi is turned OFF or not Wifi attached");
+      toUpdate_.pop_front();
+      expectNotification("UpdateFailed", "");
+      continue;
+    }
+    expectedUrl_ = *url;
+    return;
+  }
+  wanted_.clear();
+  endCheck();
+}
+
+bool Rules::installs(const std::string& url, const WebAnswer& answer) {
+  std::string name = url.substr(url.rfind('/') + 1);
+  name.resize(std::min(name.size(), name.find(".gz")));
+  const std::string final = kDatabases + "/" + name;
+  const std::string temporary = final + ".tmp";
+  info(kUpdater, "uncompressing to " + temporary);
+  const auto fails = [&] {
+    error(kUpdater, "Failed to commit the data to file for " + temporary);
+    return false;
+  };
+  if (!answer.contentType) {
+    error(kUpdater, "Cannot find Content-Type header in response!");
+    return fails();
+  }
+  if (answer.contentType->find("gzip") == std::string::npos) {
+    error(kUpdater,
+          "Expected to find gzip in Content-Type header, found " + *answer.contentType + " instead");
+    return fails();
+  }
+  if (!answer.body.starts_with("gz:")) {
+    error(kUpdater, "Could not uncompress HTTP response to " + temporary + "!");
+    files_.erase(temporary);
+    return fails();
+  }
+  filesBefore_ = files_;
+  files_.erase(temporary);
+  if (files_.contains(final)) info(kUpdater, "Removed old database " + final);
+  info(kUpdater, "Moving " + temporary + " to " + final);
+  files_[final] = {S_IFREG | 0644, answer.body.substr(3), 0, 0};
+  const int type = toUpdate_.front();
+  const Manifest::Entry& entry = wanted_[type];
+  std::vector<std::pair<std::string, PropertyList>> record{{"ContentURL", PropertyList::string(*entry.url)}};
+  if (entry.version) record.emplace_back("Version", PropertyList::string(*entry.version));
+  Domain& domain = domains_["com.norvale.lasd"];
+  domain.mayHaveFile = true;
+  Values& values = domain.keys[nameOfType(type)];
+  Values both = values.empty() ? Values{PropertyList()} : values;
+  values = {PropertyList::dictionary(record)};
+  both.push_back(values.front());
+  undo_ = [this, type, both] { domains_["com.norvale.lasd"].keys[nameOfType(type)] = both; };
+  info(kUpdater, std::string("Downloaded ") + nameOfType(type) + " database version " +
+                     entry.version.value_or("(null)") + " successfully");
+  return true;
+}
+
+void Rules::databaseEnds(bool ok) {
+  const int type = toUpdate_.front();
+  toUpdate_.pop_front();
+  expectNotification(ok ? "UpdateAvailable" : "UpdateFailed", ok ? nameOfType(type) : "");
+  nextDatabase();
+}
+
+// What a domain holds after a death: each key what it had, or what the request under way was to give it.
+void Rules::settlesOn(const Tree& disk, const std::string& domain, Domain& there) {
+  const auto found = disk.find("/root/Library/Preferences/" + domain + ".plist");
+  const PropertyList all = found != disk.end() ? parsed(found->second.content) : PropertyList();
+  if (found != disk.end() && !all.is(PropertyList::Type::dictionary)) {
+    breach("after a death, the domain " + domain + " is not whole");
+  }
+  for (auto& [key, values] : there.keys) {
+    const PropertyList value = all.find(key);
+    if (std::find(values.begin(), values.end(), value) == values.end()) {
+      breach("after a death, the key " + key + " of the domain " + domain + " has another value");
+    }
+    values = {value};
+  }
+}
+
+void Rules::afterDeath(const Tree& disk, bool hadPower) {
+  if (undo_) (*undo_)();
+  for (auto& [domain, there] : domains_) settlesOn(disk, domain, there);
+  for (auto each = files_.begin(); each != files_.end();) {
+    each = isHidden(each->first) ? files_.erase(each) : std::next(each);
+  }
+  std::set<std::string> paths;
+  for (const auto* tree : {&disk, static_cast<const Tree*>(&files_)}) {
+    for (const auto& [path, item] : *tree) {
+      if (!isHidden(path)) paths.insert(path);
+    }
+  }
+  const auto itemOf = [](const Tree& tree, const std::string& path) {
+    const auto found = tree.find(path);
+    return found == tree.end() ? Item() : found->second;
+  };
+  // A power cut may take back what was done to an owner or a mode, of which no answer promises more.
+  const auto isSame = [hadPower](const Item& a, const Item& b) {
+    return hadPower ? a == b : (a.mode & S_IFMT) == (b.mode & S_IFMT) && a.content == b.content;
+  };
+  for (const std::string& path : paths) {
+    const Item left = itemOf(disk, path);
+    const bool isUnsureOfIt =
+        !hadPower && std::any_of(unsureFiles_.begin(), unsureFiles_.end(), [&](const auto& each) {
+          return path == each || path.starts_with(each + "/");
+        });
+    if (isUnsureOfIt || isSame(left, itemOf(files_, path))) continue;
+    if (filesBefore_ && isSame(left, itemOf(*filesBefore_, path))) continue;
+    // A database under way: the old one goes before the new one comes, and an unfinished one is left.
+    if (filesBefore_ && path.starts_with(kDatabases + "/") && (left.mode == 0 || path.ends_with(".tmp")))
+      continue;
+    breach("after a death, the file " + path + " is \"" + left.content + "\" instead of \"" +
+           itemOf(files_, path).content + "\"");
+  }
+  files_ = disk;
+  unsureFiles_.clear();
+  isAnswered();
+}
+
+void Rules::comparesWith(const Tree& disk) {
+  for (const auto& [path, item] : files_) {
+    if (isHidden(path)) continue;
+    const auto found = disk.find(path);
+    if (found == disk.end()) {
+      breach("the file " + path + " is missing");
+    } else if (!(found->second == item)) {
+      breach("the file " + path + " is \"" + found->second.content + "\" mode " +
+             std::to_string(found->second.mode) + " of " + std::to_string(found->second.uid) +
+             " instead of \"" + item.content + "\" mode " + std::to_string(item.mode) + " of " +
+             std::to_string(item.uid));
+    }
+  }
+  for (const auto& [path, item] : disk) {
+    if (!isHidden(path) && !files_.contains(path)) breach("the file " + path + " should not be there");
+  }
+}
+
+}  // namespace brenvik::simulation

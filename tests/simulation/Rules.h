@@ -1,0 +1,255 @@
+// SPDX-License-Identifier: Apache-2.0
+// SPDX-FileCopyrightText: The BrenvikMobileHelper authors
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <deque>
+#include <functional>
+#include <map>
+#include <optional>
+#include <set>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "Disk.h"
+#include "Services.h"
+#include "World.h"
+#include "interface/Wire.h"
+#include "platform/geo/GeoService.h"
+#include "platform/plist/PropertyList.h"
+
+// What the helper has to do, said a second time and without looking at its code: which answer each request
+// gets, which lines the log gets, what is pushed, which files there are, and when the process leaves.
+namespace brenvik::simulation {
+
+// A line of the log.
+struct Line {
+  bool isBsd = false;
+  int level = 0;
+  std::string text;
+  bool isBeginning = false;  // any text that begins so
+};
+
+// A request: its row in the table of routines, and its arguments.
+struct Call {
+  std::size_t row = 0;
+  std::vector<std::string> texts;
+  std::vector<std::string> regions;
+  std::int32_t value = 0;
+  double latitude = 0;
+  double longitude = 0;
+  // What is wrong with the message.
+  enum class Form { right, shorter, longer, complexFlag, wrongLength, wrongType, unknownId };
+  Form form = Form::right;
+};
+
+// A reply, or what a reply must be.
+struct Answer {
+  KernelReturn code = 0;
+  std::optional<bool> flag;
+  std::optional<std::string> text;
+  std::optional<std::string> payload;  // the bytes of the region; empty: none
+};
+
+struct Expected {
+  std::vector<KernelReturn> codes;
+  std::optional<bool> flag;
+  std::optional<std::string> text;
+  std::function<bool(const std::string& payload)> isRightPayload;
+};
+
+// The update server's manifest.
+struct Manifest {
+  bool isDictionary = true;
+  struct Entry {
+    bool isDictionary = true;
+    std::optional<std::string> version;
+    std::optional<std::string> url;
+  };
+  std::map<std::string, Entry> entries;
+  std::string body;
+};
+
+// What the rules have to know of the world around the helper.
+struct Surroundings {
+  std::optional<std::string> countryCode;
+  bool telephonyIsAbsent = false;
+  std::int32_t telephonyError = 0;
+  bool lasdListens = true;
+  bool hostsBaseband = false;
+  bool basebandIsBusy = false;
+  bool contactsAreReachable = true;
+  std::optional<std::string> contactsError;
+  bool isSubscribed = false;
+  bool echoIsSilent = false;
+  bool outOfDescriptors = false;
+  int archiveResult = 0;
+  std::optional<int> archiveFatal;
+};
+
+class Rules {
+ public:
+  Rules(World& world, const Surroundings& around, Tree files);
+
+  // ---- the helper's life ----
+  void begins();
+  void exits(int status);
+  void wasKilled();
+  // After a death: what is left on the disk.
+  void afterDeath(const Tree& disk, bool hadPower);
+  // Whether the files are as they must be.
+  void comparesWith(const Tree& disk);
+  // Before anything else happens at this moment.
+  void timePasses();
+  // At a moment at which nothing is left to be done.
+  void settles();
+
+  // ---- check-in ----
+  // The codes that it may get; `isAllowed` is what the entitlement files say of the living process.
+  std::vector<KernelReturn> codesOfCheckIn(std::pair<pid_t, std::uint32_t> process, bool isAlive,
+                                           bool isAllowed, bool portIsDead);
+  void checkedIn(std::pair<pid_t, std::uint32_t> process, int connection, KernelReturn code);
+  void processExits(std::pair<pid_t, std::uint32_t> process) { granted_.erase(process); }
+  void portDies(int connection);
+
+  // ---- requests ----
+  Expected before(const Call& call);
+  // The reply of the last one has gone out: what it did must not be lost any more.
+  void isAnswered() {
+    undo_.reset();
+    filesBefore_.reset();
+  }
+  // Lack of memory: the request may fail, and its lines may be missing.
+  bool isUnsure = false;
+
+  // ---- what the helper does ----
+  void logs(const std::string& actor, bool isBsd, int level, std::string text);
+  void pushes(const std::string& what, const std::vector<std::optional<std::string>>& values);
+  void notifies(const PropertyList& notification);
+  void geoSubmitted(bool isCivic);
+  void geoAnswers(bool isCivic, const std::optional<MapItems>& items, const std::optional<std::string>& ip,
+                  const std::optional<std::string>& error);
+  void webSends(const std::string& url);
+  void webAnswers(const std::string& url, const WebAnswer& answer);
+
+  // What was wrong so far; the first of it counts.
+  void breach(const std::string& text) {
+    if (!finding_) finding_ = text;
+  }
+  const std::optional<std::string>& finding() const noexcept { return finding_; }
+
+  // The manifests that were ever served, by their bytes.
+  std::map<std::string, Manifest> manifests;
+  bool isRunning() const noexcept { return isRunning_; }
+  std::string state() const;
+
+ private:
+  using Values = std::vector<PropertyList>;  // what a key may have, each as good as the other
+  struct Domain {
+    bool mayHaveFile = false;
+    std::map<std::string, Values> keys;
+  };
+
+  void expect(const std::string& actor, Line line);
+  void info(const std::string& actor, std::string text) { expect(actor, {false, 6, std::move(text)}); }
+  void error(const std::string& actor, std::string text) { expect(actor, {false, 3, std::move(text)}); }
+  void standard(const std::string& actor, std::string text) { expect(actor, {false, 5, std::move(text)}); }
+  void bsdError(const std::string& actor, std::string text) { expect(actor, {true, 3, std::move(text)}); }
+  void bsdNotice(const std::string& actor, std::string text) { expect(actor, {true, 5, std::move(text)}); }
+
+  // The idle rule.
+  void cancelIdle() { idle_.reset(); }
+  void idleSince(Time earliest, Time latest);
+  void takeToken();
+  void giveToken(Time earliest, Time latest);
+
+  void settlesOn(const Tree& disk, const std::string& domain, Domain& there);
+
+  // The routines, by their rows.
+  Expected voicemail(const Call& call);
+  Expected setPreference(const Call& call);
+  Expected copyPreference(const Call& call, const char* which);
+  Expected loadPlist(const Call& call);
+  Expected replaceLink(const Call& call);
+  Expected createLink(const Call& call);
+  Expected removeFile(const Call& call);
+  Expected copyFile(const Call& call);
+  Expected copyCrashLogs(const Call& call);
+  Expected moveBundle(const Call& call);
+  Expected labels(const Call& call, bool badges);
+  Expected remap(const Call& call);
+  Expected heartbeat(const Call& call);
+  Expected checkDatabases(const Call& call);
+
+  bool isListed(const std::string& path);
+  bool isAllowed(const std::string& path);
+  bool exists(const std::string& path, bool* isDirectory = nullptr) const;
+  bool hasBelow(const std::string& folder) const;
+  bool makeFolders(const std::string& path);
+  bool placeLink(const std::string& path, const std::string& target);
+  void copyBelow(const std::string& from, const std::string& to, bool move);
+
+  // The databases.
+  void beginCheck();
+  void endCheck();
+  void compareManifest(const Manifest& manifest);
+  void nextDatabase();
+  void databaseArrives(const std::string& url, const WebAnswer& answer);
+  bool installs(const std::string& url, const WebAnswer& answer);
+  void databaseEnds(bool ok);
+  void expectNotification(const std::string& name, const std::string& type);
+
+  void resolveHeartbeat();
+  void pushCivic(const std::vector<std::string>& texts);
+  void pushAddress(const std::string& address);
+  std::string countryCode(const std::string& actor);
+
+  World& world_;
+  const Surroundings& around_;
+  std::optional<std::string> finding_;
+  bool isRunning_ = false;
+
+  std::map<std::string, std::deque<Line>> lines_;  // that must come, by the thread
+  std::string lastBeginning_;                      // the last line of which the rules know the beginning
+  std::deque<std::vector<std::optional<std::string>>> pushes_;
+  std::deque<std::pair<std::string, std::string>> notifications_;
+
+  std::set<std::pair<pid_t, std::uint32_t>> granted_;
+  std::set<int> clients_;
+  int tokens_ = 0;
+  struct Idle {
+    Time earliest;
+    Time latest;
+  };
+  std::optional<Idle> idle_;  // the next tick
+
+  std::map<std::string, Domain> domains_;
+  std::optional<std::string> token_;
+  std::map<std::string, std::string> tokens2_;
+  Tree files_;
+  std::set<std::string> unsureFiles_;  // whose copies need not have got to the disk
+
+  bool isAwaiting_ = false;
+  std::deque<std::pair<Time, bool>> timeOuts_;  // when, and whether of a civic request
+
+  std::deque<std::uint32_t> checks_;  // masks; the first one runs
+  std::map<int, PropertyList> local_;
+  std::map<int, Manifest::Entry> wanted_;
+  std::deque<int> toUpdate_;
+  std::string expectedUrl_;
+
+  int heldHeartbeat_ = 0;
+  std::deque<std::pair<Time, bool>> heartbeats_;  // commands that wait for a probe
+  // What the request under way may have left undone if the helper dies.
+  std::optional<std::function<void()>> undo_;
+  std::optional<Tree> filesBefore_;
+};
+
+// Field texts as the routines see them.
+std::string cut(const std::string& field, std::size_t size, bool isTerminated);
+bool isUtf8(const std::string& text);
+
+}  // namespace brenvik::simulation
