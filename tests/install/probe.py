@@ -15,7 +15,9 @@ import sys
 
 CALLERS = "/run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper.callers"
 LIBC = ctypes.CDLL(None, use_errno=True)
-PROCESS_VM_READV, PROCESS_VM_WRITEV, PTRACE, PIDFD_OPEN, PIDFD_GETFD = 310, 311, 101, 434, 438
+# Each architecture has numbers of its own for the older system calls.
+PROCESS_VM_READV, PROCESS_VM_WRITEV, PTRACE = {"x86_64": (310, 311, 101), "aarch64": (270, 271, 117)}[os.uname().machine]
+PIDFD_OPEN, PIDFD_GETFD = 434, 438
 
 
 def attempt(function, *arguments):
