@@ -110,6 +110,12 @@ class Units(unittest.TestCase):
         self.assertEqual(self.values("ProtectHome"), ["tmpfs"])
         self.assertEqual(sorted(self.values("TemporaryFileSystem")), ["/home:ro", "/root:ro", "/run/user:ro"])
 
+    def test_a_private_tmp_is_in_memory_where_the_service_manager_can_make_it_so(self):
+        version = re.search(r"^systemd_VERSION:\w+=(\d+)", (BUILD / "CMakeCache.txt").read_text(), re.M)[1]
+        wanted = ["yes", "disconnected"] if int(version) >= 257 else ["yes"]
+        for name in MOST_EXPOSED:
+            self.assertEqual(self.values("PrivateTmp", name), wanted, name)
+
     def test_the_folders_that_are_bound_in_are_made_before_it_starts(self):
         made = {line.split()[1] for line in (BUILD / "units" / "brenvik.tmpfiles").read_text().splitlines()
                 if line.startswith("d ")}
