@@ -153,8 +153,8 @@ int runComposed(const HelperPlatform& platform, const HelperState& state) {
       .idlePeriod = platform.idlePeriod,
       .describeCaller = [&entitlements](const AuditToken& caller) { return entitlements.describe(caller); },
       .onChange = [&telling] { telling.changed(); },
-      .releaseMemory = platform.releaseMemory,
-      .now = platform.now};
+      .now = platform.now,
+      .releaseMemory = platform.releaseMemory};
   const auto endWork = [&telling, &serving] {
     telling.end();
     if (serving != nullptr) serving->shutDown();

@@ -116,7 +116,20 @@ class Units(unittest.TestCase):
 
     def test_nothing_can_be_stored_in_the_place_of_the_homes_it_hides(self):
         self.assertEqual(self.values("ProtectHome"), ["tmpfs"])
-        self.assertEqual(sorted(self.values("TemporaryFileSystem")), ["/home:ro", "/root:ro", "/run/user:ro"])
+        self.assertEqual(sorted(self.values("TemporaryFileSystem")), ["/home:ro", "/root:ro", "/run/host:ro", "/run/user:ro"])
+
+    def test_a_private_tmp_is_in_memory_where_the_service_manager_can_make_it_so(self):
+        version = re.search(r"^systemd_VERSION:\w+=(\d+)", (BUILD / "CMakeCache.txt").read_text(), re.M)[1]
+        wanted = ["yes", "disconnected"] if int(version) >= 257 else ["yes"]
+        for name in (NETWORK, STORES):
+            self.assertEqual(self.values("PrivateTmp", name), wanted, name)
+        # It would take the place of the machine's /tmp, where packages arrive.
+        self.assertEqual(self.values("PrivateTmp"), ["yes"])
+
+    def test_the_link_to_os_release_of_newer_service_managers_has_a_place_of_its_own(self):
+        for name in MOST_EXPOSED:
+            if self.values("RootDirectory", name):
+                self.assertIn("/run/host:ro", self.values("TemporaryFileSystem", name), name)
 
     def test_the_folders_that_are_bound_in_are_made_before_it_starts(self):
         made = {line.split()[1] for line in (BUILD / "units" / "brenvik.tmpfiles").read_text().splitlines()
