@@ -680,9 +680,7 @@ def a_caller_worker_that_was_taken_over_is_held():
     fields = dict(line.split(":\t") for line in pathlib.Path(f"/proc/{process}/status").read_text().splitlines() if ":\t" in line)
     expect_equal((int(fields["CapPrm"], 16), int(fields["CapEff"], 16), int(fields["CapBnd"], 16)), (1 << 19,) * 3, "CAP_SYS_PTRACE")
     expect_equal((fields["NoNewPrivs"], fields["Seccomp"]), ("1", "2"), "no new privileges, filters")
-    helper = pathlib.Path(f"/proc/{property_of(SERVICE, 'MainPID')}/status").read_text()
-    of_units = int(dict(line.split(":\t") for line in helper.splitlines() if ":\t" in line)["Seccomp_filters"])
-    expect(int(fields["Seccomp_filters"]) >= of_units + 1, f"filters of its own: {fields['Seccomp_filters']}, {of_units} of a unit")
+    expect_equal(int(fields["Seccomp_filters"]), found["filters"] + 2, "the unit's filters and two of its own")
     expect(0 not in map(int, fields["Uid"].split() + fields["Gid"].split()), "it is not root")
 
 

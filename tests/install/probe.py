@@ -109,6 +109,8 @@ def main():
     }
     for folder in ("/home", "/root", "/var/mobile", "/run/user", "/tmp"):
         result["sees " + folder] = attempt(lambda: sorted(os.listdir(folder)))
+    with open("/proc/self/status", encoding="utf-8") as status:
+        result["filters"] = next(int(line.split()[1]) for line in status if line.startswith("Seccomp_filters:"))
     # The way around: another process's root, and what is mounted there.
     result["around"] = attempt(lambda: sorted(os.listdir("/proc/1/root/home")))
     result["memory_around"] = attempt(writes_memory, f"/proc/1/root/proc/{victim}/mem")

@@ -36,7 +36,7 @@ WorkerRights callerRights() {
 #ifdef SYS_poll  // newer architectures have ppoll alone
   rights.onlyCalls.push_back(SYS_poll);
 #endif
-  rights.descriptors = 32;
+  rights.descriptors = 128;
   rights.addressSpace = rlim_t{64} << 20;
   return rights;
 }

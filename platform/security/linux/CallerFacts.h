@@ -37,9 +37,10 @@ std::string executablePathOf(int folder);
 // `folder` may be O_PATH. Throws std::bad_alloc.
 CallerFacts callerFactsOf(int folder);
 
-// The protocol between the helper and the caller worker. One channel serves any number of questions. A
-// question is the process's folder in /proc, as a descriptor; the answer follows before the next question.
-// Encoding and decoding throw std::bad_alloc; decoding returns nothing for a malformed message.
+// The protocol between the helper and the caller worker. One channel serves any number of questions, and
+// others wait until it closes. A question is the process's folder in /proc, as a descriptor; the answer
+// follows before the next question. Encoding and decoding throw std::bad_alloc; decoding returns nothing for
+// a malformed message.
 namespace callers {
 
 inline constexpr const char* kService = "com.norvale.brenvik.mobile-helper.callers";

@@ -10,35 +10,31 @@
 namespace brenvik {
 
 std::optional<CallerFacts> RemoteCallerReader::read(int folder) {
-  const std::lock_guard lock(mutex_);
   const auto deadline = Clock::now() + patience_;
   for (int attempt = 0;; ++attempt) {
+    WorkerChannel channel;
     WorkerMessage answer;
-    const WorkerResult result = exchange(folder, deadline, &answer);
-    if (result == WorkerResult::outOfMemory) {
-      channel_.close();  // an answer that is under way answers nothing any more
-      throw std::bad_alloc();
-    }
+    const WorkerResult result = exchange(folder, deadline, &channel, &answer);
+    if (result == WorkerResult::outOfMemory) throw std::bad_alloc();
     if (result == WorkerResult::done) {
       if (auto facts = callers::decode(answer)) return facts;
     }
-    channel_.discard(&answer);
-    worker_.giveUp(&channel_);
+    channel.discard(&answer);
+    worker_.giveUp(&channel);
     if (result != WorkerResult::closed || attempt > 0) return std::nullopt;
   }
 }
 
-WorkerResult RemoteCallerReader::exchange(int folder, Clock::time_point deadline, WorkerMessage* answer) {
+WorkerResult RemoteCallerReader::exchange(int folder, Clock::time_point deadline, WorkerChannel* channel,
+                                          WorkerMessage* answer) {
   WorkerMessage question;
   question.kind = callers::kFacts;
   question.descriptors.emplace_back(::fcntl(folder, F_DUPFD_CLOEXEC, 0));
   if (!question.descriptors.back().isValid()) return WorkerResult::outOfMemory;
-  if (!channel_.isOpen()) {
-    const WorkerResult opened = worker_.open(callers::kFacts, &channel_);
-    if (opened != WorkerResult::done) return opened;
-  }
-  const WorkerResult sent = channel_.send(question);
-  return sent == WorkerResult::done ? channel_.receive(answer, deadline) : sent;
+  const WorkerResult opened = worker_.open(callers::kFacts, channel);
+  if (opened != WorkerResult::done) return opened;
+  const WorkerResult sent = channel->send(question);
+  return sent == WorkerResult::done ? channel->receive(answer, deadline) : sent;
 }
 
 }  // namespace brenvik

@@ -3,7 +3,6 @@
 #pragma once
 
 #include <chrono>
-#include <mutex>
 #include <optional>
 
 #include "platform/security/linux/CallerFacts.h"
@@ -20,9 +19,9 @@ class CallerReader {
   virtual std::optional<CallerFacts> read(int folder) = 0;
 };
 
-// Asks the caller worker, and waits for its answer. One that has gone is replaced, and the new one asked once
-// more; one that does not answer in time, or sends a malformed answer, is given up, and the next question has
-// another.
+// Asks the caller worker, over a channel for each question, and waits for its answer. One that has gone is
+// replaced, and the new one asked once more; one that does not answer in time, or sends a malformed answer,
+// is given up, and the next question has another.
 class RemoteCallerReader final : public CallerReader {
  public:
   // A start of its service takes a tenth of a second on a busy machine, an answer some microseconds.
@@ -36,12 +35,11 @@ class RemoteCallerReader final : public CallerReader {
 
  private:
   using Clock = std::chrono::steady_clock;
-  WorkerResult exchange(int folder, Clock::time_point deadline, WorkerMessage* answer);
+  WorkerResult exchange(int folder, Clock::time_point deadline, WorkerChannel* channel,
+                        WorkerMessage* answer);
 
   Worker& worker_;
   const std::chrono::milliseconds patience_;
-  std::mutex mutex_;  // guards the channel, and makes one question wait for the other's answer
-  WorkerChannel channel_;
 };
 
 }  // namespace brenvik

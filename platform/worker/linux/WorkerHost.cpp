@@ -23,8 +23,9 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-// The helper has one connection, and one that is restarted has one more for a moment.
-constexpr std::size_t kMaxConnections = 8;
+// The helper has one connection, and one that is restarted has one more for a moment. Several helpers, each with
+// a socket of its own, share a worker.
+constexpr std::size_t kMaxConnections = 64;
 
 bool isRoots(int connection) noexcept {
   const auto peer = peerOf(connection);
