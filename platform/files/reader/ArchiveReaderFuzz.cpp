@@ -79,7 +79,7 @@ std::string name(FuzzInput& input) {
                                      "a//b", "a\\b", "._a",   "__MACOSX/", "__MACOSX/._a", "\xC3\xA9",
                                      "\xFF", ".",    "a/b/c", "a/./b"};
   const std::size_t which = input.below(kNames.size() + 2);
-  return which < kNames.size() ? kNames[which] : std::string(input.text());
+  return which < kNames.size() ? kNames[which] : std::string(input.text(2));
 }
 
 std::string archive(FuzzInput& input) {

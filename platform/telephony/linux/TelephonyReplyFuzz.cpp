@@ -58,7 +58,10 @@ Datagram nextDatagram(FuzzInput& input, std::int32_t id) {
   Datagram bytes(whole.begin(), whole.end());
   if (how % 4 == 2) bytes.resize(offsetof(TelephonyPushReply, result));
   if ((how & 0x40) != 0) bytes.resize(input.byte() % 80);
-  if ((how & 0x80) != 0 && !bytes.empty()) bytes[input.byte() % bytes.size()] = std::byte{input.byte()};
+  if ((how & 0x80) != 0 && !bytes.empty()) {
+    const std::size_t at = input.byte() % bytes.size();
+    bytes[at] = std::byte{input.byte()};
+  }
   return bytes;
 }
 
