@@ -23,8 +23,8 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-// The helper has one connection, and one that is restarted has one more for a moment. Several helpers, each with
-// a socket of its own, share a worker.
+// The helper has one connection, and one that is restarted has one more for a moment. Several helpers, each
+// with a socket of its own, share a worker.
 constexpr std::size_t kMaxConnections = 64;
 
 bool isRoots(int connection) noexcept {
