@@ -18,6 +18,7 @@
 #include <utility>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/base/fakes/FailingAllocations.h"
 
 // The calls as the C library has them, and as the helper's code makes them in this program; see
 // CMakeLists.txt. The names are the linker's.
@@ -193,6 +194,7 @@ Tree Disk::read() const {
 }
 
 void Disk::beforeChange() {
+  const FailingAllocations::Pause pause;
   if (left_ > 0 && --left_ == 0) std::exchange(then_, {})();
 }
 
@@ -207,6 +209,7 @@ Disk::Names Disk::namesIn(const std::string& path) {
 }
 
 void Disk::synced(int file) {
+  const FailingAllocations::Pause pause;
   struct stat facts {};
   if (::fstat(file, &facts) != 0) return;
   const std::string path = "/proc/self/fd/" + std::to_string(file);
@@ -228,6 +231,7 @@ void Disk::syncBelow(const std::string& path) {
 }
 
 void Disk::syncedAll() {
+  const FailingAllocations::Pause pause;
   synced_.clear();
   syncBelow("/");
 }

@@ -236,6 +236,12 @@ Call callOf(Random& random) {
       call.form = random.oneIn(2) ? Call::Form::wrongLength : Call::Form::wrongType;
     }
   }
+  // Rows whose fakes can do with a lack of memory, and which leave nothing running.
+  constexpr std::array memoryRows{4, 6, 7, 8, 9, 10, 11, 15, 16, 17, 19, 23};
+  if (call.form == Call::Form::right && random.oneIn(12) &&
+      std::find(memoryRows.begin(), memoryRows.end(), static_cast<int>(call.row)) != memoryRows.end()) {
+    call.failsAt = static_cast<long>(random.below(random.oneIn(2) ? 12 : 80));
+  }
   return call;
 }
 

@@ -139,7 +139,7 @@ class Machine final : public LogSink {
   void serve(const ServiceMessage& message);
   void serve(int connection, const Call& call);
   Answer dispatch(PortName port, std::vector<std::byte>& bytes, std::uint32_t size,
-                  const MessageTrailer& trailer, const std::vector<std::string>& regions, Outcome* outcome);
+                  const MessageTrailer& trailer, long failsAt, Outcome* outcome);
   void check(const Call& call, const Expected& expected, const Answer& answer);
   void observe();
   void observeNotifications();

@@ -138,7 +138,7 @@ Rules::Rules(World& world, const Surroundings& around, Tree files)
 void Rules::expect(const std::string& actor, Line line) { lines_[actor].push_back(std::move(line)); }
 
 void Rules::logs(const std::string& actorName, bool isBsd, int level, std::string text) {
-  if (world_.isKilled() || isUnsure) return;
+  if (world_.isKilled() || isUnsure_) return;
   timePasses();
   const std::string actor = actorName == "com.norvale.httpdownloadqueue" ? kUpdater : actorName;
   if (text.ends_with('\n')) text.pop_back();
@@ -471,7 +471,7 @@ Expected Rules::copyPreference(const Call& call, const char* which) {
     if (values.size() > 1) domains_[domain].keys[key] = {value};
     std::deque<Line>& waiting = lines_[kMain];
     if (payload.empty() && !waiting.empty()) waiting.pop_front();
-    return payload.empty() ||
+    return payload.empty() || isUnsure_ ||
            lastBeginning_ == "VM_ALLOCATE " + std::to_string(payload.size()) + "l (" + which + ")";
   };
   const bool isThere = std::any_of(values.begin(), values.end(), [](const auto& each) { return !!each; });
@@ -1144,9 +1144,22 @@ void Rules::settlesOn(const Tree& disk, const std::string& domain, Domain& there
   }
 }
 
+void Rules::becomesSure(const Tree& disk) {
+  isUnsure_ = false;
+  if (undo_) (*undo_)();
+  filesSettleOn(disk, false);
+  lines_[kMain].clear();
+}
+
 void Rules::afterDeath(const Tree& disk, bool hadPower) {
   if (undo_) (*undo_)();
   for (auto& [domain, there] : domains_) settlesOn(disk, domain, there);
+  filesSettleOn(disk, hadPower);
+  unsureFiles_.clear();
+}
+
+// The files, after what may have ended early.
+void Rules::filesSettleOn(const Tree& disk, bool hadPower) {
   for (auto each = files_.begin(); each != files_.end();) {
     each = isHidden(each->first) ? files_.erase(each) : std::next(each);
   }
@@ -1175,11 +1188,10 @@ void Rules::afterDeath(const Tree& disk, bool hadPower) {
     // A database under way: the old one goes before the new one comes, and an unfinished one is left.
     if (filesBefore_ && path.starts_with(kDatabases + "/") && (left.mode == 0 || path.ends_with(".tmp")))
       continue;
-    breach("after a death, the file " + path + " is \"" + left.content + "\" instead of \"" +
+    breach("after an early end, the file " + path + " is \"" + left.content + "\" instead of \"" +
            itemOf(files_, path).content + "\"");
   }
   files_ = disk;
-  unsureFiles_.clear();
   isAnswered();
 }
 

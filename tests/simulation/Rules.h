@@ -44,6 +44,8 @@ struct Call {
   // What is wrong with the message.
   enum class Form { right, shorter, longer, complexFlag, wrongLength, wrongType, unknownId };
   Form form = Form::right;
+  // The allocation that fails while it is served, counted from 0; none if it is negative.
+  long failsAt = -1;
 };
 
 // A reply, or what a reply must be.
@@ -122,8 +124,11 @@ class Rules {
     undo_.reset();
     filesBefore_.reset();
   }
-  // Lack of memory: the request may fail, and its lines may be missing.
-  bool isUnsure = false;
+  // Between the two, memory is short: the request may fail, and its lines may be missing; what it did is done
+  // or not.
+  void becomesUnsure() { isUnsure_ = true; }
+  void becomesSure(const Tree& disk);
+  bool isUnsure() const noexcept { return isUnsure_; }
 
   // ---- what the helper does ----
   void logs(const std::string& actor, bool isBsd, int level, std::string text);
@@ -169,6 +174,8 @@ class Rules {
   void settlesOn(const Tree& disk, const std::string& domain, Domain& there);
 
   // The routines, by their rows.
+  void filesSettleOn(const Tree& disk, bool hadPower);
+
   Expected voicemail(const Call& call);
   Expected setPreference(const Call& call);
   Expected copyPreference(const Call& call, const char* which);
@@ -211,6 +218,7 @@ class Rules {
   const Surroundings& around_;
   std::optional<std::string> finding_;
   bool isRunning_ = false;
+  bool isUnsure_ = false;
 
   std::map<std::string, std::deque<Line>> lines_;  // that must come, by the thread
   std::string lastBeginning_;                      // the last line of which the rules know the beginning

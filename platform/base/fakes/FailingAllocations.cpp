@@ -20,6 +20,10 @@ FailingAllocations::FailingAllocations(long first, HowMany howMany) noexcept {
 
 FailingAllocations::~FailingAllocations() { failing.isArmed = false; }
 
+FailingAllocations::Pause::Pause() noexcept : wasArmed_(failing.isArmed) { failing.isArmed = false; }
+
+FailingAllocations::Pause::~Pause() { failing.isArmed = wasArmed_; }
+
 long FailingAllocations::failures() noexcept { return failing.failed; }
 
 }  // namespace brenvik

@@ -21,6 +21,18 @@ class FailingAllocations {
   FailingAllocations(const FailingAllocations&) = delete;
   FailingAllocations& operator=(const FailingAllocations&) = delete;
 
+  // While it lives, nothing fails on this thread, and nothing is counted: for what belongs to the test.
+  class Pause {
+   public:
+    Pause() noexcept;
+    ~Pause();
+    Pause(const Pause&) = delete;
+    Pause& operator=(const Pause&) = delete;
+
+   private:
+    const bool wasArmed_;
+  };
+
   // The number of allocations that have failed since then.
   static long failures() noexcept;
 };

@@ -4,24 +4,28 @@
 
 #include <map>
 #include <memory>
+#include <new>
 #include <string>
 
 #include "platform/ipc/RegionAllocator.h"
 
 namespace brenvik {
 
-// Regions on the heap, counted; refuses with a code of the test's choosing.
+// Regions on the heap, counted; refuses with a code of the test's choosing, and when memory runs out.
 class HeapRegions final : public RegionAllocator {
  public:
-  KernelReturn allocate(void** address, std::size_t length) noexcept override {
+  KernelReturn allocate(void** address, std::size_t length) noexcept override try {
     ++calls;
     lastLength = length;
     *address = nullptr;
     if (refuseWith != kern::success) return refuseWith;
     auto bytes = std::make_unique<char[]>(length == 0 ? 1 : length);
-    *address = bytes.get();
-    live_.emplace(*address, std::move(bytes));
+    void* const start = bytes.get();
+    live_.emplace(start, std::move(bytes));
+    *address = start;
     return kern::success;
+  } catch (const std::bad_alloc&) {
+    return kern::resourceShortage;
   }
   void deallocate(void* address, std::size_t) noexcept override { live_.erase(address); }
 
