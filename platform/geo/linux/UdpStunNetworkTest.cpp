@@ -8,6 +8,7 @@
 #include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
+#include <sys/time.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -34,6 +35,8 @@ constexpr StunTransactionId kId{std::byte{7}};
 class Server {
  public:
   explicit Server(int family = AF_INET) : socket_(::socket(family, SOCK_DGRAM | SOCK_CLOEXEC, 0)) {
+    constexpr timeval kPatience{30, 0};  // a request that never comes is a failure, not a test without end
+    EXPECT_EQ(::setsockopt(socket_.get(), SOL_SOCKET, SO_RCVTIMEO, &kPatience, sizeof kPatience), 0);
     sockaddr_storage address{};
     address.ss_family = static_cast<sa_family_t>(family);
     if (family == AF_INET) {
