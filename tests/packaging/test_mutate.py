@@ -185,7 +185,7 @@ class Mistakes(unittest.TestCase):
         better = self.mutate("platform/a")
         self.assertEqual(better.returncode, 0, better.stdout)
         self.assertNotIn("survived:", better.stdout)
-        self.assertRegex(better.stdout, r"platform/a +\d+ +\d+ +0 +2 +\d+ +100 %\n")
+        self.assertRegex(better.stdout, r"platform/a +\d+ +\d+ +0 +2 +\d+ +100\.0 %\n")
 
         # A reason is not left out.
         self.write("tests/mutations/equivalent.txt", "platform/a/A.cpp\n- int waits = 0;\n+ int waits = 1;\n")

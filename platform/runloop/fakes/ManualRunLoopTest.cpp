@@ -33,13 +33,29 @@ TEST(ManualWorkQueueTest, TimerFiresRepeatedlyUntilCancelled) {
   queue.runReady();
   EXPECT_EQ(fired, 0) << "inactive until activated";
   timer->activate();
-  clock.advance(4s);
-  queue.runReady();
+  for (int second = 0; second <= 4; ++second) {
+    queue.runReady();
+    clock.advance(1s);
+  }
   EXPECT_EQ(fired, 3);
   timer->cancel();
   clock.advance(10s);
   queue.runReady();
   EXPECT_EQ(fired, 3);
+}
+
+TEST(ManualWorkQueueTest, TicksThatCouldNotRunYetBecomeOne) {
+  ManualClock clock;
+  ManualWorkQueue queue(clock);
+  int fired = 0;
+  const auto timer = queue.makeTimer(0s, 2s, 0s, [&] { ++fired; });
+  timer->activate();
+  clock.advance(9s);
+  queue.runReady();
+  EXPECT_EQ(fired, 1);
+  clock.advance(1s);
+  queue.runReady();
+  EXPECT_EQ(fired, 2);
 }
 
 TEST(ManualRunLoopTest, TimerCanBeDestroyedByItsOwnHandler) {

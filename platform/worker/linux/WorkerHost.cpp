@@ -23,10 +23,6 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-// The helper has one connection, and one that is restarted has one more for a moment. Several helpers, each
-// with a socket of its own, share a worker.
-constexpr std::size_t kMaxConnections = 64;
-
 bool isRoots(int connection) noexcept {
   const auto peer = peerOf(connection);
   return peer && peer->uid == 0;
@@ -55,7 +51,7 @@ class Connections {
       std::vector<pollfd> waited;
       for (const WorkerChannel& channel : channels_) waited.push_back({channel.descriptor(), POLLIN, 0});
       // One that is full of connections leaves the others in the socket.
-      if (listening.isValid() && channels_.size() < kMaxConnections)
+      if (listening.isValid() && channels_.size() < WorkerHost::kMaxConnections)
         waited.push_back({listening.get(), POLLIN, 0});
       if (waited.empty()) return;
       if (::poll(waited.data(), waited.size(), -1) < 0) {

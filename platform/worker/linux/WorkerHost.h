@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #pragma once
 
+#include <cstddef>
 #include <functional>
 #include <string>
 
@@ -17,6 +18,10 @@ class WorkerHost {
     std::string service;  // the name of the service whose socket the service manager may hand over
     WorkerRights rights;
   };
+
+  // How many connections a service serves at once; more wait in the socket. A helper has one, and a second
+  // for a moment while it is restarted; several helpers, each with a socket of its own, can share a worker.
+  static constexpr std::size_t kMaxConnections = 64;
 
   // Gets a channel that the helper has opened, and the kind of its work. Runs on the main thread, which waits
   // for it before it takes the next channel, so the work itself must be done on another thread. May throw

@@ -471,12 +471,12 @@ class WorkerServiceTest : public WorkerProgramTest {
   }
 };
 
-TEST_F(WorkerServiceTest, AServiceTakesEightConnectionsAndOneMoreWhenOneHasHungUp) {
+TEST_F(WorkerServiceTest, AServiceTakesSoManyConnectionsAndOneMoreWhenOneHasHungUp) {
   if (::geteuid() != 0) GTEST_SKIP() << "a worker talks to root only";
   const UniqueFd socket = listen(SOCK_SEQPACKET, 16);
   const pid_t child = startAsService(socket);
   std::vector<WorkerChannel> connections;
-  for (int i = 0; i < 8; ++i) {
+  for (std::size_t i = 0; i < WorkerHost::kMaxConnections; ++i) {
     WorkerChannel channel;
     ASSERT_EQ(openOn(connections.emplace_back(connect()), &channel), WorkerResult::done);
     ASSERT_TRUE(echoes(channel));
