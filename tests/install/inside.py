@@ -1017,7 +1017,9 @@ def upgrade_under_a_living_telephony_daemon():
         if "/usr/lib/sysctl.d" in pathlib.Path("/var/lib/dpkg/info/systemd.triggers").read_text():
             # After each upgrade of a package with kernel settings, that of the service manager applies those of all files.
             setting = pathlib.Path("/etc/sysctl.d/50-administrator.conf")
-            setting.parent.mkdir(exist_ok=True)
+            if not setting.parent.exists():
+                setting.parent.mkdir()
+                stack.callback(setting.parent.rmdir)
             setting.write_text("net.ipv4.ping_group_range = 0 7\n")
             stack.callback(setting.unlink)
         stack.enter_context(names(lasd_norvale_example="127.0.0.1", stun_norvale_example="127.0.0.1"))

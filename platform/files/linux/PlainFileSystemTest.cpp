@@ -41,6 +41,11 @@ extern "C" int openat(int directory, const char* path, int flags, ...) {
   }
   return static_cast<int>(::syscall(SYS_openat, directory, path, flags, mode));
 }
+// What openat() without a mode becomes where the C library's headers check calls (_FORTIFY_SOURCE).
+extern "C" int checkedOpenat(int directory, const char* path, int flags) __asm__("__openat_2");
+extern "C" int checkedOpenat(int directory, const char* path, int flags) {
+  return openat(directory, path, flags, 0);
+}
 extern "C" int renameat2(int fromFolder, const char* from, int toFolder, const char* to,
                          unsigned flags) noexcept {
   if (brenvik::FailingCall::failsNow("renameat2")) return -1;

@@ -34,15 +34,20 @@
 
 // Calls of this program that a test may let fail. None of the opens here makes a file. Only the symbols have
 // the names of the C library: where its headers check sizes (_FORTIFY_SOURCE), they define functions of these
-// names.
+// names, and call others, which clang's programs then do.
 extern "C" {
 ssize_t failingRead(int fd, void* bytes, std::size_t size) __asm__("read");
+ssize_t failingCheckedRead(int fd, void* bytes, std::size_t size, std::size_t room) __asm__("__read_chk");
 ssize_t failingGetdents64(int fd, void* bytes, std::size_t size) noexcept __asm__("getdents64");
 int failingLstat(const char* path, struct stat* facts) noexcept __asm__("lstat");
 int failingOpenat(int directory, const char* path, int flags, ...) __asm__("openat");
+int failingCheckedOpenat(int directory, const char* path, int flags) __asm__("__openat_2");
 
 ssize_t failingRead(int fd, void* bytes, std::size_t size) {
   return brenvik::FailingCall::failsNow("read") ? -1 : ::syscall(SYS_read, fd, bytes, size);
+}
+ssize_t failingCheckedRead(int fd, void* bytes, std::size_t size, std::size_t /*room*/) {
+  return failingRead(fd, bytes, size);
 }
 ssize_t failingGetdents64(int fd, void* bytes, std::size_t size) noexcept {
   return brenvik::FailingCall::failsNow("getdents64") ? -1 : ::syscall(SYS_getdents64, fd, bytes, size);
@@ -54,6 +59,9 @@ int failingLstat(const char* path, struct stat* facts) noexcept {
 int failingOpenat(int directory, const char* path, int flags, ...) {
   if (brenvik::FailingCall::failsNow("openat")) return -1;
   return static_cast<int>(::syscall(SYS_openat, directory, path, flags, 0));
+}
+int failingCheckedOpenat(int directory, const char* path, int flags) {
+  return failingOpenat(directory, path, flags);
 }
 }
 
