@@ -151,7 +151,7 @@ function(brenvik_e2e_test name)
     endif()
     add_test(NAME ${test}
       COMMAND ${PROJECT_SOURCE_DIR}/tests/e2e/sandbox ${PROJECT_BINARY_DIR} /usr/bin/python3 -W error::ResourceWarning
-        ../${ARG_FOLDER}/${name}.py ${class})
+        ${PROJECT_SOURCE_DIR}/tests/${ARG_FOLDER}/${name}.py ${class})
     set_tests_properties(${test} PROPERTIES LABELS "e2e" TIMEOUT ${ARG_TIMEOUT} SKIP_RETURN_CODE 77
                          COST ${ARG_TIMEOUT})  # the longest first: they mostly wait
   endforeach()
