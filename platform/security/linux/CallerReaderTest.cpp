@@ -117,6 +117,34 @@ TEST_F(CallerReaderTest, AWorkerThatHangsIsGivenUpInTimeAndTheNextQuestionHasAno
   EXPECT_TRUE(ask(reader));
 }
 
+TEST_F(CallerReaderTest, ManyQuestionsToAWorkerThatHangsWaitHalfOfTheTimeAtMost) {
+  using Clock = RemoteCallerReader::Clock;
+  constexpr std::chrono::seconds kPatience{20};
+  std::atomic<bool> answers = false;
+  ThreadedWorker worker([&](std::uint32_t, WorkerChannel channel) {
+    WorkerMessage question;
+    while (channel.receive(&question, kForEver) == WorkerResult::done) {
+      if (answers) (void)channel.send(callers::encode(someFacts()));
+    }
+  });
+  Clock::duration ahead{};
+  RemoteCallerReader reader(worker, kPatience, [&] { return Clock::now() + ahead; });
+  const auto began = Clock::now();
+  for (int left = 3; left > 0; --left) {
+    ahead = -left * kPatience;  // the time of this question is over when it is asked
+    EXPECT_FALSE(ask(reader));
+  }
+  EXPECT_EQ(worker.givenUp(), 3);
+  ahead = {};
+  for (int i = 0; i < 5; ++i) EXPECT_FALSE(ask(reader));
+  EXPECT_LT(Clock::now() - began, kPatience / 2);
+  EXPECT_EQ(worker.givenUp(), 3)
+      << "one that is starting is not ended by those who wait less than that takes";
+  answers = true;
+  ahead = kPatience;
+  EXPECT_TRUE(ask(reader)) << "waiting is possible again";
+}
+
 TEST_F(CallerReaderTest, AnAnswerOfAnotherFormIsNoneAndItsWorkerIsGivenUp) {
   const auto lies = [&](const char* what, const std::function<void(WorkerMessage*)>& change) {
     ThreadedWorker worker(answering([&] {
