@@ -4,20 +4,36 @@
 
 #include <fcntl.h>
 
+#include <algorithm>
 #include <new>
 #include <utility>
 
 namespace brenvik {
+namespace {
+
+constexpr int kInARow = 3;
+// Enough for a worker that is at work.
+constexpr std::chrono::milliseconds kLeastPatience{10};
+
+}  // namespace
 
 std::optional<CallerFacts> RemoteCallerReader::read(int folder) {
-  const auto deadline = Clock::now() + patience_;
+  const auto began = now_();
+  const Clock::duration patience = std::min<Clock::duration>(
+      patience_, std::max<Clock::duration>(kLeastPatience, kInARow * patience_ - (paidAt_.load() - began)));
   for (int attempt = 0;; ++attempt) {
     WorkerChannel channel;
     WorkerMessage answer;
-    const WorkerResult result = exchange(folder, deadline, &channel, &answer);
+    const WorkerResult result = exchange(folder, began + patience, &channel, &answer);
     if (result == WorkerResult::outOfMemory) throw std::bad_alloc();
     if (result == WorkerResult::done) {
       if (auto facts = callers::decode(answer)) return facts;
+    }
+    if (result == WorkerResult::timedOut) {
+      paidAt_ =
+          std::min(std::max(paidAt_.load(), began) + 2 * patience, began + patience + kInARow * patience_);
+      // It may be starting, and need more time than that.
+      if (patience < patience_) return std::nullopt;
     }
     channel.discard(&answer);
     worker_.giveUp(&channel);

@@ -100,9 +100,9 @@ TEST_F(CallerReaderTest, AWorkerThatDiesOfAQuestionIsReplacedOnceAndTheNextQuest
 }
 
 TEST_F(CallerReaderTest, AWorkerThatHangsIsGivenUpInTimeAndTheNextQuestionHasAnother) {
-  std::atomic<int> served = 0;
+  std::atomic<bool> hangs =
+      true;  // not by the order of their threads, of which a late one may be the first's
   ThreadedWorker worker([&](std::uint32_t, WorkerChannel channel) {
-    const bool hangs = served++ == 0;
     WorkerMessage question;
     while (channel.receive(&question, kForEver) == WorkerResult::done) {
       if (!hangs) (void)channel.send(callers::encode(someFacts()));
@@ -113,8 +113,37 @@ TEST_F(CallerReaderTest, AWorkerThatHangsIsGivenUpInTimeAndTheNextQuestionHasAno
     EXPECT_FALSE(ask(reader));
     EXPECT_EQ(worker.givenUp(), 1);
   }
+  hangs = false;
   RemoteCallerReader reader(worker);
   EXPECT_TRUE(ask(reader));
+}
+
+TEST_F(CallerReaderTest, ManyQuestionsToAWorkerThatHangsWaitHalfOfTheTimeAtMost) {
+  using Clock = RemoteCallerReader::Clock;
+  constexpr std::chrono::seconds kPatience{20};
+  std::atomic<bool> answers = false;
+  ThreadedWorker worker([&](std::uint32_t, WorkerChannel channel) {
+    WorkerMessage question;
+    while (channel.receive(&question, kForEver) == WorkerResult::done) {
+      if (answers) (void)channel.send(callers::encode(someFacts()));
+    }
+  });
+  Clock::duration ahead{};
+  RemoteCallerReader reader(worker, kPatience, [&] { return Clock::now() + ahead; });
+  const auto began = Clock::now();
+  for (int left = 3; left > 0; --left) {
+    ahead = -left * kPatience;  // the time of this question is over when it is asked
+    EXPECT_FALSE(ask(reader));
+  }
+  EXPECT_EQ(worker.givenUp(), 3);
+  ahead = {};
+  for (int i = 0; i < 5; ++i) EXPECT_FALSE(ask(reader));
+  EXPECT_LT(Clock::now() - began, kPatience / 2);
+  EXPECT_EQ(worker.givenUp(), 3)
+      << "one that is starting is not ended by those who wait less than that takes";
+  answers = true;
+  ahead = kPatience;
+  EXPECT_TRUE(ask(reader)) << "waiting is possible again";
 }
 
 TEST_F(CallerReaderTest, AnAnswerOfAnotherFormIsNoneAndItsWorkerIsGivenUp) {
