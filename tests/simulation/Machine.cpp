@@ -649,7 +649,8 @@ void Machine::serve(int id, const Call& call) {
   const Expected expected = rules.before(call);
   Outcome outcome{};
   const MessageTrailer trailer{};
-  trace("call of " + std::string(facts.name) + " on connection " + std::to_string(id));
+  trace("call of " + std::string(facts.name) + " (" + std::to_string(call.value) + ") on connection " +
+        std::to_string(id));
   if (call.failsAt >= 0) rules.becomesUnsure();
   const Answer answer = dispatch(connection.port, bytes, size, trailer, call.failsAt, &outcome);
   if (world.isKilled()) return;

@@ -209,6 +209,7 @@ void Rules::begins() {
 
 void Rules::exits(int status) {
   if (status != 0) return breach("the helper left with status " + std::to_string(status));
+  if (!heartbeats_.empty()) resolveHeartbeat();
   const Time now = world_.now();
   if (!idle_) {
     breach("the helper left while it was not idle: " + state());
@@ -296,6 +297,7 @@ std::vector<KernelReturn> Rules::codesOfCheckIn(std::pair<pid_t, std::uint32_t> 
 
 void Rules::checkedIn(std::pair<pid_t, std::uint32_t> process, int connection, KernelReturn code) {
   if (code == 35) return;
+  timePasses();
   granted_.insert(process);
   if (code == 0) {
     clients_.insert(connection);
@@ -308,6 +310,7 @@ void Rules::checkedIn(std::pair<pid_t, std::uint32_t> process, int connection, K
 }
 
 void Rules::portDies(int connection) {
+  timePasses();  // a token that came back before came back while there was a client
   if (clients_.erase(connection) > 0) idleSince(world_.now(), world_.now());
 }
 
@@ -631,12 +634,18 @@ Expected Rules::copyFile(const Call& call) {
   };
   if (!exists(to) && !makeFolders(to)) return fails();
   if (!exists(source)) return fails();
-  const bool isThere = exists(destination);
+  bool isFolder = false;
+  const bool isThere = exists(destination, &isFolder);
   if (!isThere && files_.contains(destination)) return fails();  // a link to nothing is in the way
   files_[source].uid = files_[source].gid = 0;
-  Item copy = files_[source];
-  copy.uid = copy.gid = kMobile;
-  files_[destination] = copy;
+  if (isFolder) {
+    // Into the folder goes the copy, to the account the folder; a folder in the copy's place is no failure.
+    Item& copy = files_[destination + "/" + name];
+    if (!S_ISDIR(copy.mode)) copy = files_[source];
+  } else {
+    files_[destination] = files_[source];
+  }
+  files_[destination].uid = files_[destination].gid = kMobile;
   return flagged(true);
 }
 
