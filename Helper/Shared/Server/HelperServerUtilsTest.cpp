@@ -277,6 +277,45 @@ TEST_F(ServerTest, TheFactsSayWhatKeepsTheServer) {
   EXPECT_TRUE(facts.isKeptByIdleCheck);
 }
 
+TEST_F(ServerTest, ItCountsDownFromTheMomentThatNothingKeepsItUntilSomethingDoesAgain) {
+  create();
+  EXPECT_FALSE(server->isCountingDown()) << "no client ever connected";
+  const auto token = AcquireBusyToken(*server);
+  EXPECT_FALSE(server->isCountingDown());
+  ReleaseBusyToken(*server, token);
+  EXPECT_TRUE(server->isCountingDown());
+  ASSERT_EQ(checkIn(), kern::success);
+  EXPECT_FALSE(server->isCountingDown());
+  clientDies(0);
+  EXPECT_TRUE(server->isCountingDown());
+}
+
+TEST_F(ServerTest, TheIdleChecksAnswerIsForgottenWithTheCountdownInWhichItWasGiven) {
+  platform.now = [this] { return clock.now(); };
+  create();
+  SetIdleCheck(server.get(), [] { return true; });
+  countDown();
+  clock.advance(10s);
+  EXPECT_TRUE(server->facts().isKeptByIdleCheck);
+  const auto token = AcquireBusyToken(*server);
+  EXPECT_FALSE(server->facts().isKeptByIdleCheck) << "the token keeps it";
+  ReleaseBusyToken(*server, token);
+  EXPECT_EQ(server->facts().leavesIn, 10s);
+  EXPECT_FALSE(server->facts().isKeptByIdleCheck) << "the check was not asked yet";
+}
+
+TEST_F(ServerTest, ATickThatIsLateLeavesTheFactsAt0UntilItComesAndThenAtThePeriodsNextEnd) {
+  std::chrono::nanoseconds late{0};
+  platform.now = [&] { return clock.now() + late; };
+  create();
+  SetIdleCheck(server.get(), [] { return true; });
+  countDown();
+  late = 23s;
+  EXPECT_EQ(server->facts().leavesIn, 0s);
+  clock.advance(10s);
+  EXPECT_EQ(server->facts().leavesIn, 7s) << "the ticks of 10, 20 and 30 s have passed as one";
+}
+
 TEST_F(ServerTest, WhoeverIsToldOfAChangeMayAskForTheFacts) {
   std::vector<std::size_t> clients;
   platform.onChange = [&] { clients.push_back(server->facts().clients); };
@@ -303,6 +342,43 @@ TEST_F(ServerTest, MemoryIsGivenBackOnceMostOfManyClientsHaveGoneAndNotForAFew) 
   EXPECT_EQ(left, std::vector<std::size_t>{0});
   clock.advance(5s);
   EXPECT_EQ(left.size(), 1U);
+}
+
+TEST_F(ServerTest, MostOfManyClientsHaveGoneWhenAnEighthIsLeftAndAfterThatOnlyWhenAsManyHaveComeAgain) {
+  std::vector<std::size_t> left;
+  platform.releaseMemory = [&] { left.push_back(server->facts().clients); };
+  create();
+  std::size_t next = 0;
+  const auto die = [&](int many) {
+    for (int i = 0; i < many; ++i) clientDies(next++);
+  };
+  for (int i = 0; i < 256; ++i) ASSERT_EQ(checkIn(), kern::success);
+  die(223);
+  clock.advance(5s);
+  EXPECT_TRUE(left.empty()) << "33 are left";
+  die(1);
+  clock.advance(1s);
+  EXPECT_EQ(left, std::vector<std::size_t>{32});
+  die(32);
+  clock.advance(5s);
+  EXPECT_EQ(left.size(), 1U) << "a few more have gone";
+  for (int i = 0; i < 256; ++i) ASSERT_EQ(checkIn(), kern::success);
+  die(256);
+  clock.advance(5s);
+  EXPECT_EQ(left, (std::vector<std::size_t>{32, 0}));
+}
+
+TEST_F(ServerTest, ClientsThatComeAndGoBeforeTheMemoryIsGivenBackDoNotPutThatOff) {
+  std::vector<std::chrono::nanoseconds> released;
+  platform.releaseMemory = [&] { released.push_back(clock.now()); };
+  create();
+  for (std::size_t round = 0; round < 2; ++round) {
+    for (int i = 0; i < 256; ++i) ASSERT_EQ(checkIn(), kern::success);
+    for (std::size_t i = 0; i < 256; ++i) clientDies(round * 256 + i);
+    clock.advance(500ms);
+  }
+  clock.advance(5s);
+  EXPECT_EQ(released, std::vector<std::chrono::nanoseconds>{1s});
 }
 
 TEST_F(ServerTest, WithoutAHostedServerTheProcessStopsAtTheFirstTick10SecondsAfterTheLastClient) {
@@ -435,6 +511,21 @@ TEST_F(ServerTest, WithAll32TokensHeldTheNextOneIs1Again) {
   for (int i = 0; i < 32; ++i) AcquireBusyToken(*server);
   EXPECT_EQ(server->busyMask(), 0xFFFFFFFFU);
   EXPECT_EQ(AcquireBusyToken(*server), 1U);
+}
+
+TEST_F(ServerTest, EachOf32TokensHasItsReasonAndTheNextOneReplacesThatOfTheFirst) {
+  create();
+  AcquireBusyToken(*server, "first");
+  for (int i = 1; i < 31; ++i) AcquireBusyToken(*server, "between");
+  AcquireBusyToken(*server, "last");
+  using Tokens = std::vector<std::pair<std::string, std::size_t>>;
+  const auto expectTokens = [&](const Tokens& expected) {
+    const auto held = server->facts().busyTokens;
+    EXPECT_EQ(Tokens(held.begin(), held.end()), expected);
+  };
+  expectTokens({{"first", 1}, {"between", 30}, {"last", 1}});
+  AcquireBusyToken(*server, "one more");
+  expectTokens({{"one more", 1}, {"between", 30}, {"last", 1}});
 }
 
 TEST_F(ServerTest, ReleasingATokenWhileOthersAreHeldDoesNotStartTheCountdown) {
