@@ -156,13 +156,23 @@ WorkerResult WorkerChannel::send(const WorkerMessage& message) noexcept {
 }
 
 WorkerResult WorkerChannel::receive(WorkerMessage* message, Clock::time_point deadline) noexcept {
+  alignas(8) std::array<std::byte, WorkerMessage::kLongestPayload> room;  // written by the kernel only
+  return receiveInto(room, message, deadline);
+}
+
+WorkerResult WorkerChannel::receiveShort(WorkerMessage* message, Clock::time_point deadline) noexcept {
+  alignas(8) std::array<std::byte, WorkerMessage::kShortPayload> room;
+  return receiveInto(room, message, deadline);
+}
+
+WorkerResult WorkerChannel::receiveInto(std::span<std::byte> bytes, WorkerMessage* message,
+                                        Clock::time_point deadline) noexcept {
   message->kind = 0;
   message->payload.clear();
   message->descriptors.clear();
   if (!socket_.isValid()) return WorkerResult::closed;
 
   std::uint32_t kind = 0;
-  alignas(8) std::array<std::byte, WorkerMessage::kLongestPayload> bytes;  // written by the kernel only
   const std::array<iovec, 2> pieces{{{&kind, sizeof kind}, {bytes.data(), bytes.size()}}};
   Received received(isDistrusted_);
   const WorkerResult waited = awaitDatagram(socket_.get(), pieces, deadline, &received);

@@ -3,7 +3,9 @@
 #pragma once
 
 #include <chrono>
+#include <cstddef>
 #include <cstdint>
+#include <span>
 #include <utility>
 
 #include "platform/base/UniqueFd.h"
@@ -33,6 +35,10 @@ class WorkerChannel {
   // `malformed`.
   WorkerResult receive(WorkerMessage* message, std::chrono::steady_clock::time_point deadline) noexcept;
 
+  // The same for a payload of at most kShortPayload bytes; a longer one is malformed. Takes little stack,
+  // whose pages the process would keep.
+  WorkerResult receiveShort(WorkerMessage* message, std::chrono::steady_clock::time_point deadline) noexcept;
+
   // For an event loop: readable when receive() would not wait. The channel owns it.
   int descriptor() const noexcept { return socket_.get(); }
   bool isOpen() const noexcept { return socket_.isValid(); }
@@ -54,6 +60,9 @@ class WorkerChannel {
   void setGeneration(std::uint64_t generation) noexcept { generation_ = generation; }
 
  private:
+  WorkerResult receiveInto(std::span<std::byte> bytes, WorkerMessage* message,
+                           std::chrono::steady_clock::time_point deadline) noexcept;
+
   UniqueFd socket_;
   std::uint64_t generation_ = 0;
   bool isDistrusted_ = false;

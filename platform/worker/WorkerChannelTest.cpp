@@ -79,6 +79,21 @@ TEST_F(WorkerChannelTest, TheLongestMessageArrivesAndALongerOneIsNotSent) {
   EXPECT_EQ(one.send(sent), WorkerResult::malformed);
 }
 
+TEST_F(WorkerChannelTest, WhereAShortMessageIsWaitedForALongOneIsMalformed) {
+  WorkerMessage sent;
+  sent.kind = 5;
+  sent.payload.resize(WorkerMessage::kShortPayload, std::byte{7});
+  ASSERT_EQ(one.send(sent), WorkerResult::done);
+  ASSERT_EQ(other.receiveShort(&message, Clock::now()), WorkerResult::done);
+  EXPECT_EQ(message.kind, 5U);
+  EXPECT_EQ(message.payload, sent.payload);
+  sent.payload.emplace_back();
+  ASSERT_EQ(one.send(sent), WorkerResult::done);
+  EXPECT_EQ(other.receiveShort(&message, Clock::now()), WorkerResult::malformed);
+  EXPECT_TRUE(message.payload.empty());
+  EXPECT_EQ(other.receiveShort(&message, Clock::now()), WorkerResult::timedOut);
+}
+
 TEST_F(WorkerChannelTest, NothingThereIsATimeOut) {
   EXPECT_EQ(receiveNow(other), WorkerResult::timedOut);
   const auto before = Clock::now();

@@ -14,6 +14,7 @@ namespace brenvik {
 // the layout of the payload (WorkerFields.h). The helper must not trust anything that a worker sends.
 struct WorkerMessage {
   static constexpr std::size_t kLongestPayload = 60'000;  // bytes; with its head it fits one datagram
+  static constexpr std::size_t kShortPayload = 8'192;     // bytes; what receiveShort() has room for
   static constexpr std::size_t kMaxDescriptors = 4;
 
   std::uint32_t kind = 0;

@@ -50,7 +50,7 @@ WorkerResult RemoteCallerReader::exchange(int folder, Clock::time_point deadline
   const WorkerResult opened = worker_.open(callers::kFacts, channel);
   if (opened != WorkerResult::done) return opened;
   const WorkerResult sent = channel->send(question);
-  return sent == WorkerResult::done ? channel->receive(answer, deadline) : sent;
+  return sent == WorkerResult::done ? channel->receiveShort(answer, deadline) : sent;
 }
 
 }  // namespace brenvik

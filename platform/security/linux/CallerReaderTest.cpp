@@ -6,11 +6,15 @@
 #include <gtest/gtest.h>
 #include <limits.h>
 #include <linux/capability.h>
+#include <pthread.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <array>
 #include <atomic>
 #include <functional>
 #include <new>
@@ -74,6 +78,53 @@ TEST_F(CallerReaderTest, WhatTheWorkerDoesNotKnowIsNotKnown) {
   EXPECT_EQ(facts->executablePath, "");
   EXPECT_FALSE(facts->userNamespace);
 }
+
+TEST_F(CallerReaderTest, TheLongestPathIsTaken) {
+  CallerFacts longest = someFacts();
+  longest.executablePath.assign(PATH_MAX, 'x');
+  ThreadedWorker worker(answering([&] { return callers::encode(longest); }));
+  RemoteCallerReader reader(worker);
+  const auto facts = ask(reader);
+  ASSERT_TRUE(facts);
+  EXPECT_EQ(facts->executablePath, longest.executablePath);
+}
+
+#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
+// A process keeps the pages of its stack that were used once.
+TEST_F(CallerReaderTest, AQuestionTakesLittleStack) {
+  ThreadedWorker worker(answering([] { return callers::encode(someFacts()); }));
+  struct Asked {
+    RemoteCallerReader reader;
+    int folder;
+    bool isAnswered = false;
+  } asked{RemoteCallerReader(worker), folder.get()};
+  constexpr std::size_t kPage = 4096;
+  constexpr std::size_t kSize = 64 * kPage;
+  void* const stack = ::mmap(nullptr, kSize, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+  ASSERT_NE(stack, MAP_FAILED);
+  pthread_attr_t attributes;
+  ::pthread_attr_init(&attributes);
+  ASSERT_EQ(::pthread_attr_setstack(&attributes, stack, kSize), 0);
+  pthread_t thread{};
+  ASSERT_EQ(::pthread_create(
+                &thread, &attributes,
+                [](void* argument) -> void* {
+                  auto* const it = static_cast<Asked*>(argument);
+                  it->isAnswered = it->reader.read(it->folder).has_value();
+                  return nullptr;
+                },
+                &asked),
+            0);
+  ::pthread_join(thread, nullptr);
+  ::pthread_attr_destroy(&attributes);
+  EXPECT_TRUE(asked.isAnswered);
+  std::array<unsigned char, kSize / kPage> pages{};
+  ASSERT_EQ(::mincore(stack, kSize, pages.data()), 0);
+  const auto lowest = std::find_if(pages.begin(), pages.end(), [](unsigned char each) { return each & 1; });
+  EXPECT_LE((pages.end() - lowest) * kPage, 32U << 10);
+  ::munmap(stack, kSize);
+}
+#endif
 
 TEST_F(CallerReaderTest, AWorkerThatDiedBetweenTwoQuestionsIsReplaced) {
   ThreadedWorker worker(answering([] { return callers::encode(someFacts()); }));
