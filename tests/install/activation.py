@@ -4,9 +4,10 @@
 """How long the service manager takes from a connection to the first reply, the whole sandbox of the unit included,
 beside systemd-hostnamed, which is started by a message on the system bus. Runs in a container, as root, once.
 
-usage: activation.py [--rounds N] [--directives] [UNIT.service ...]
+usage: activation.py [--rounds N] [--directives] [--worker] [UNIT.service ...]
   --directives   also the installed unit without each of its directives, one at a time
-  UNIT.service   also these, in place of the installed unit
+  --worker       also with the caller worker's unit without each of its directives, one at a time, and without any
+  UNIT.service   also these, in place of the installed unit, or of the caller worker's if they start its program
 
 Contestants take turns. Ratios are of medians; the middle half of all times stands beside each. The last time is the
 processor time of the service's process until then, the making of its sandbox included: it says more where others are at work
@@ -26,6 +27,7 @@ import time
 
 SERVICE = pathlib.Path("/lib/systemd/system/brenvik-mobile-helper.service")
 SOCKET = pathlib.Path("/lib/systemd/system/brenvik-mobile-helper.socket")
+WORKER = pathlib.Path("/lib/systemd/system/brenvik-caller-worker.service")
 SERVICE_PATH = "/run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper"
 PEER = "systemd-hostnamed.service"
 MOST_OF_PEER = 0.45
@@ -47,7 +49,8 @@ class Helper:
     """The service with one form of its unit: the installed socket unit under a name and a path of its own."""
     library = None
 
-    def __init__(self, label, number, text):
+    def __init__(self, label, number, text, worker=None):
+        self.worker = worker
         self.label, self.unit, self.path = label, f"activation{number}.service", f"/run/activation/{number}"
         self.times, self.processor = [], []
         units = pathlib.Path("/run/systemd/system")
@@ -111,26 +114,50 @@ def directives(text):
             if re.match(r"[A-Z]\w+=", line) and not line.startswith(NOT_SANDBOX)]
 
 
+def without_sandbox(text):
+    for line in directives(text):
+        text = text.replace(line + "\n", "", 1)
+    return text
+
+
 def contestants(arguments):
     text = SERVICE.read_text()
-    without_any = text
-    for line in directives(text):
-        without_any = without_any.replace(line + "\n", "", 1)
-    forms = [("as installed", text), ("without any sandbox", without_any)]
+    forms = [("as installed", text), ("without any sandbox", without_sandbox(text))]
     for each in arguments.units:
-        forms.append((pathlib.Path(each).stem, pathlib.Path(each).read_text()))
+        other = pathlib.Path(each).read_text()
+        forms.append((pathlib.Path(each).stem, *((text, other) if "/brenvik-caller-worker\n" in other else (other,))))
     if arguments.directives:
         names = [(name,) for name in dict.fromkeys(line.split("=")[0] for line in directives(text))
                  if name not in A_ROOT_OF_ITS_OWN]
         forms += [(f"without {'=, '.join(each)}=", re.sub(rf"^({'|'.join(each)})=.*\n", "", text, flags=re.M))
                   for each in [A_ROOT_OF_ITS_OWN, *names]]
-    return [Peer(), *(Helper(label, number, form) for number, (label, form) in enumerate(forms))]
+    if arguments.worker:
+        worker = WORKER.read_text()
+        kept = ("CapabilityBoundingSet", "AmbientCapabilities", "DynamicUser", *A_ROOT_OF_ITS_OWN)
+        names = [name for name in dict.fromkeys(line.split("=")[0] for line in directives(worker)) if name not in kept]
+        forms += [("worker without any sandbox", text, without_sandbox(worker))]
+        forms += [(f"worker without {'=, '.join(each)}=", text, re.sub(rf"^({'|'.join(each)})=.*\n", "", worker, flags=re.M))
+                  for each in [A_ROOT_OF_ITS_OWN, *((name,) for name in names)]]
+    return [Peer(), *(Helper(form[0], number, *form[1:]) for number, form in enumerate(forms))]
+
+
+def with_worker(text):
+    """From now on the caller worker's unit is this; None: the installed one."""
+    file = pathlib.Path("/run/systemd/system", WORKER.name)
+    if text == (file.read_text() if file.exists() else None):
+        return
+    if text is None:
+        file.unlink()
+    else:
+        file.write_text(text)
+    run("systemctl", "daemon-reload")
 
 
 def main():
     parser = argparse.ArgumentParser(add_help=False)
     parser.add_argument("--rounds", type=int, default=25)
     parser.add_argument("--directives", action="store_true")
+    parser.add_argument("--worker", action="store_true")
     parser.add_argument("units", nargs="*")
     arguments = parser.parse_args()
 
@@ -145,6 +172,7 @@ def main():
         each.prepare()
     for turn in range(-1, arguments.rounds):  # the first is for files that have to come from the disk
         for each in all_of_them if turn % 2 else reversed(all_of_them):
+            with_worker(getattr(each, "worker", None))
             took = each.first_reply()
             if turn >= 0:
                 each.times.append(took)

@@ -121,7 +121,7 @@ TEST_F(CallerReaderTest, AQuestionTakesLittleStack) {
   std::array<unsigned char, kSize / kPage> pages{};
   ASSERT_EQ(::mincore(stack, kSize, pages.data()), 0);
   const auto lowest = std::find_if(pages.begin(), pages.end(), [](unsigned char each) { return each & 1; });
-  EXPECT_LE((pages.end() - lowest) * kPage, 32U << 10);
+  EXPECT_LE(static_cast<std::size_t>(pages.end() - lowest) * kPage, std::size_t{32} << 10);
   ::munmap(stack, kSize);
 }
 #endif
