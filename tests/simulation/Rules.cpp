@@ -639,9 +639,11 @@ Expected Rules::copyFile(const Call& call) {
   if (!isThere && files_.contains(destination)) return fails();  // a link to nothing is in the way
   files_[source].uid = files_[source].gid = 0;
   if (isFolder) {
-    // Into the folder goes the copy, to the account the folder; a folder in the copy's place is no failure.
+    // Into the folder goes the copy, to the account the folder. Where a folder is in the copy's place, the
+    // answer says so, and no line of the log.
     Item& copy = files_[destination + "/" + name];
-    if (!S_ISDIR(copy.mode)) copy = files_[source];
+    if (S_ISDIR(copy.mode)) return flagged(false);
+    copy = files_[source];
   } else {
     files_[destination] = files_[source];
   }
@@ -1193,7 +1195,12 @@ void Rules::filesSettleOn(const Tree& disk, bool hadPower) {
           return path == each || path.starts_with(each + "/");
         });
     if (isUnsureOfIt || isSame(left, itemOf(files_, path))) continue;
-    if (filesBefore_ && isSame(left, itemOf(*filesBefore_, path))) continue;
+    if (filesBefore_) {
+      const Item before = itemOf(*filesBefore_, path);
+      // What is copied or moved is given to root first.
+      const Item given{before.mode, before.content, 0, 0};
+      if (isSame(left, before) || isSame(left, given)) continue;
+    }
     // A database under way: the old one goes before the new one comes, and an unfinished one is left.
     if (filesBefore_ && path.starts_with(kDatabases + "/") && (left.mode == 0 || path.ends_with(".tmp")))
       continue;

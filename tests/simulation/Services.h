@@ -76,13 +76,13 @@ class SimulatedWeb::Request final : public WebRequest {
   void send(std::vector<std::byte>) override {
     if (web_.world_.isKilled()) return completion_(nullptr);
     web_.onSend(url_);
-    WebAnswer got = web_.throughTheAir(*session_, web_.answer(url_));
-    web_.world_.waitFor(got.delay);
-    got = web_.throughTheAir(*session_, std::move(got));
+    WebAnswer sent = web_.throughTheAir(*session_, web_.answer(url_));
+    web_.world_.waitFor(sent.delay);
+    sent = web_.throughTheAir(*session_, std::move(sent));
     if (web_.world_.isKilled()) return completion_(nullptr);
-    web_.onAnswer(url_, got);
+    web_.onAnswer(url_, sent);
     const auto isDone = std::make_shared<bool>(false);
-    queue_->post([isDone, completion = completion_, response = responseOf(got)] {
+    queue_->post([isDone, completion = completion_, response = responseOf(sent)] {
       completion(response);
       *isDone = true;
     });

@@ -128,6 +128,7 @@ class ManualWorkQueue::ManualTimer final : public WorkQueue::Timer {
   ManualTimer(ManualWorkQueue& queue, std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
               Task handler)
       : queue_(queue),
+        clock_(queue.clock_),
         first_(first),
         interval_(interval),
         handler_(std::make_shared<Task>(std::move(handler))) {}
@@ -143,13 +144,13 @@ class ManualWorkQueue::ManualTimer final : public WorkQueue::Timer {
   void cancel() noexcept override {
     if (!active_) return;
     active_ = false;
-    queue_.clock_.cancel(id_);
+    clock_.cancel(id_);
     alive_.reset();
   }
 
  private:
   void arm(std::chrono::nanoseconds delay) {
-    id_ = queue_.clock_.schedule(delay, [this] {
+    id_ = clock_.schedule(delay, [this] {
       if (interval_.count() > 0) {
         arm(interval_);
       }
@@ -161,6 +162,7 @@ class ManualWorkQueue::ManualTimer final : public WorkQueue::Timer {
     });
   }
   ManualWorkQueue& queue_;
+  ManualClock& clock_;  // a timer may be destroyed after its queue
   const std::chrono::nanoseconds first_;
   const std::chrono::nanoseconds interval_;
   const std::shared_ptr<Task> handler_;
