@@ -131,6 +131,26 @@ TEST_F(RefusalLogTest, NumbersOfThoseThatAreForgottenAndOfAllOthersAreToldInTime
   EXPECT_EQ(log.entries().front(), line("refused 3 more check-ins of further callers"));
 }
 
+TEST_F(RefusalLogTest, OneFurtherCallerIsToldInTimeAndNoneIsNot) {
+  const auto stranger = [](std::size_t i) { return LogCaller{7, static_cast<uid_t>(i), "/x", ""}; };
+  const auto refuseAllThatAreRemembered = [&] {
+    for (std::size_t i = 0; i < RefusalLog::kMaxCallers; ++i) refuse(stranger(i));
+    log.clear();
+  };
+  refuseAllThatAreRemembered();
+  refuse(stranger(2000));
+  refuse(stranger(2001));
+  now += seconds(60);
+  refuseAllThatAreRemembered();
+  refuse(stranger(2002));
+  ASSERT_EQ(log.entries().size(), 2U);
+  EXPECT_EQ(log.entries().front(), line("refused 1 more check-ins of further callers"));
+  now += seconds(60);
+  refuseAllThatAreRemembered();
+  refuse(stranger(2003));
+  EXPECT_EQ(log.entries().size(), 1U) << "the refusal itself";
+}
+
 TEST_F(RefusalLogTest, APathAsLongAsTheSystemAllowsLeavesRoomForTheReason) {
   refuse({7, 501, "/" + std::string(4094, 'x'), ""});
   ASSERT_EQ(log.entries().size(), 1U);

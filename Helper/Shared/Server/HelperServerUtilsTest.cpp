@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <array>
+#include <csignal>
 #include <cstring>
 #include <limits>
 #include <memory>
@@ -147,7 +148,9 @@ TEST_F(ServerTest, DestructionTearsEveryClientDownAndGivesThePortBack) {
   std::vector<std::string> order;
   const auto note = [&](std::string what) {
     return [&, what] {
-      order.push_back(what + (LookupServer(registry, servicePort) == nullptr ? ", without port" : ""));
+      const bool isKnown = LookupServer(registry, servicePort) != nullptr;
+      EXPECT_EQ(ports.receiveRights.count(servicePort) != 0, isKnown);
+      order.push_back(what + (isKnown ? "" : ", without port"));
     };
   };
   sources.routineSources[0]->whenInvalidated = note("service");
@@ -609,6 +612,25 @@ TEST_F(ServerTest, TwoCheckInsGiveTwoIndependentPortsEachTornDownWhenItsWatchedP
   EXPECT_TRUE(ports.sendRights.empty());
 }
 
+TEST_F(ServerTest, AClientsRightsGoInTheOrderWatchSourceReceiveSend) {
+  create();
+  ASSERT_EQ(checkIn(), kern::success);
+  std::vector<std::string> order;
+  sources.routineSources[1]->whenInvalidated = [&] {
+    EXPECT_EQ(ports.sendRights, (std::map<PortName, int>{{clientPort, 1}})) << "the caller's is gone";
+    order.push_back("source");
+  };
+  ports.whenReceiveRightIsDropped = [&](PortName name) {
+    EXPECT_EQ(name, clientPort);
+    EXPECT_EQ(ports.sendRights.count(clientPort), 1U);
+    order.push_back("receive right");
+  };
+  clientDies(0);
+  EXPECT_EQ(order, (std::vector<std::string>{"source", "receive right"}));
+  EXPECT_TRUE(ports.sendRights.empty());
+  ports.whenReceiveRightIsDropped = {};
+}
+
 TEST_F(ServerTest, DeathOfAClientWhileABusyTokenIsHeldDoesNotArmTheTimerButItsReleaseDoes) {
   create();
   ASSERT_EQ(checkIn(), kern::success);
@@ -744,7 +766,7 @@ TEST_F(ServerTest, ADeathWithoutAContextIsTheServersThatOwnsTheWatchedPort) {
 TEST_F(ServerTest, ADeathThatBelongsToNoServerStopsTheProcessOnAnAssertion) {
   create();
   FakeDeathWatch stray(0x777);
-  EXPECT_DEATH(
+  EXPECT_EXIT(
       {
         class StandardError final : public LogSink {
           void unified(LogLevel, std::string_view line, const LogPlace&, const MessageId&) noexcept override {
@@ -755,6 +777,7 @@ TEST_F(ServerTest, ADeathThatBelongsToNoServerStopsTheProcessOnAnAssertion) {
         setLogSink(&sink);
         OnClientPortDied(stray, nullptr, registry);
       },
+      testing::KilledBySignal(SIGABRT),
       "Assertion failed: \\(server\\), function MachPortInvalidationCallBack, file HelperServerUtils, line "
       "317");
 }

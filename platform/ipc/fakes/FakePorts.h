@@ -35,7 +35,10 @@ class FakePortSpace final : public PortSpace {
   } catch (const std::bad_alloc&) {
     return kern::resourceShortage;
   }
-  KernelReturn dropReceiveRight(PortName name) noexcept override { return drop(receiveRights, name); }
+  KernelReturn dropReceiveRight(PortName name) noexcept override {
+    if (whenReceiveRightIsDropped) whenReceiveRightIsDropped(name);
+    return drop(receiveRights, name);
+  }
   KernelReturn deallocateSendRight(PortName name) noexcept override { return drop(sendRights, name); }
 
   // A right that arrived in a message.
@@ -47,6 +50,7 @@ class FakePortSpace final : public PortSpace {
 
   std::map<PortName, int> receiveRights;
   std::map<PortName, int> sendRights;
+  std::function<void(PortName)> whenReceiveRightIsDropped;  // before it is
   int failedDrops = 0;
   KernelReturn refuseAllocate = kern::success;
   KernelReturn refuseInsert = kern::success;
