@@ -78,12 +78,13 @@ void World::waitFor(Time delay) {
   SimulatedQueue* const queue = current_;
   if (isKilled_ || queue == nullptr || !queue->isOnThread_) return;
   queue->state_ = SimulatedQueue::State::waiting;
-  clock.schedule(delay, [queue] { queue->isWoken_ = true; });
+  const auto wake = clock.schedule(delay, [queue] { queue->isWoken_ = true; });
   std::unique_lock lock(mutex_);
   isOutersTurn_ = true;
   outerTurn_.notify_one();
   queue->turn_.wait(lock, [queue] { return queue->isItsTurn_; });
   queue->isItsTurn_ = false;
+  clock.cancel(wake);  // a kill ends the wait early, and then the queue
 }
 
 const std::string& World::actor() const noexcept { return current_ != nullptr ? current_->label() : actor_; }
