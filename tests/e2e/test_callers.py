@@ -276,13 +276,15 @@ class Callers(unittest.TestCase):
             service.kill()
             self.assertEqual(in_a_new_process(), 0)
 
-    def test_the_worker_leaves_with_the_helper(self):
+    def test_the_worker_stays_for_the_next_helper(self):
         service = self.service()
         daemon = self.daemon()
         self.assertEqual(in_a_new_process(), 0)
-        service.worker()
+        worker = service.worker()
         daemon.stop()
-        self.assertEqual(service.process.wait(20), 0)
+        self.daemon()
+        self.assertEqual(in_a_new_process(), 0)
+        self.assertEqual(service.worker(), worker)
 
     def test_the_worker_has_one_capability_and_no_account_of_anybodys(self):
         service = self.service()

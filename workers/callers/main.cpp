@@ -14,6 +14,7 @@ int main() {
   brenvik::SystemLog log("BrenvikMobileHelper");
   brenvik::setLogSink(&log);
   const int status = brenvik::WorkerHost::run(
-      {.service = brenvik::callers::kService, .rights = brenvik::callerRights()}, brenvik::serveCallers);
+      {.service = brenvik::callers::kService, .rights = brenvik::callerRights(), .staysForTheNext = true},
+      brenvik::serveCallers);
   ::_exit(status);
 }

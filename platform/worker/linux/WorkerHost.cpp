@@ -46,17 +46,18 @@ class Connections {
   void add(WorkerChannel connection) { channels_.push_back(std::move(connection)); }
 
   // Serves what comes on them and on the listening socket, which may be invalid, until the last has hung up.
-  void run(const UniqueFd& listening) {
+  // False when nothing can be waited for.
+  bool run(const UniqueFd& listening) {
     do {
       std::vector<pollfd> waited;
       for (const WorkerChannel& channel : channels_) waited.push_back({channel.descriptor(), POLLIN, 0});
       // One that is full of connections leaves the others in the socket.
       if (listening.isValid() && channels_.size() < WorkerHost::kMaxConnections)
         waited.push_back({listening.get(), POLLIN, 0});
-      if (waited.empty()) return;
+      if (waited.empty()) return false;
       if (::poll(waited.data(), waited.size(), -1) < 0) {
         if (errno == EINTR) continue;
-        return;
+        return false;
       }
       for (std::size_t i = channels_.size(); i-- > 0;) {
         if (waited[i].revents != 0 && !take(channels_[i]))
@@ -65,6 +66,7 @@ class Connections {
       if (listening.isValid() && waited.back().fd == listening.get() && waited.back().revents != 0)
         accept(listening);
     } while (!channels_.empty());
+    return true;
   }
 
  private:
@@ -99,7 +101,7 @@ void WorkerHost::serveConnection(WorkerChannel connection, const Serve& serve) n
   try {
     Connections connections(serve);
     connections.add(std::move(connection));
-    connections.run({});
+    (void)connections.run({});
   } catch (const std::bad_alloc&) {  // the connection closes
   }
 }
@@ -125,7 +127,8 @@ int WorkerHost::run(const Description& description, const Serve& serve) noexcept
     }
     Connections connections(serve);
     if (connection.isValid()) connections.add(WorkerChannel(std::move(connection)));
-    connections.run(listening);
+    while (connections.run(listening) && description.staysForTheNext) {
+    }
     return 0;
   } catch (const std::bad_alloc&) {
     return 1;

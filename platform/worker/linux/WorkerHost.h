@@ -17,6 +17,8 @@ class WorkerHost {
   struct Description {
     std::string service;  // the name of the service whose socket the service manager may hand over
     WorkerRights rights;
+    // A service waits for another helper when the last has hung up, instead of returning.
+    bool staysForTheNext = false;
   };
 
   // How many connections a service serves at once; more wait in the socket. A helper has one, and a second
