@@ -14,6 +14,7 @@ import pwd
 import re
 import resource
 import select
+import signal
 import socket
 import struct
 import subprocess
@@ -182,13 +183,25 @@ class Daemon:
         return status
 
     def stop(self):
+        children = self._children()
         if self.process.poll() is None:
             self.process.terminate()
         self.process.wait(20)
-        self.reader.join()
+        self.reader.join(10)
+        if self.reader.is_alive():  # somebody still has its standard error
+            for pid in children:
+                with contextlib.suppress(ProcessLookupError):
+                    os.kill(pid, signal.SIGKILL)
+            raise AssertionError(f"processes that the daemon had started outlived it: {children}")
         self.process.stderr.close()
         if self.listening is not None:
             self.listening.close()
+
+    def _children(self):
+        paths = pathlib.Path(f"/proc/{self.pid}/task").glob("*/children")
+        with contextlib.suppress(FileNotFoundError, ProcessLookupError):
+            return [int(pid) for path in paths for pid in path.read_text().split()]
+        return []
 
     def running(self):
         return self.process.poll() is None
@@ -214,11 +227,10 @@ class Daemon:
 
     def network_worker(self):
         """The process id of its network worker, None when there is none."""
-        children = pathlib.Path(f"/proc/{self.pid}/task").glob("*/children")
-        for pid in " ".join(path.read_text() for path in children).split():
+        for pid in self._children():
             with contextlib.suppress(FileNotFoundError, ProcessLookupError):
                 if "brenvik-network" in pathlib.Path(f"/proc/{pid}/cmdline").read_text():
-                    return int(pid)
+                    return pid
         return None
 
     def network_worker_maps(self):
@@ -292,6 +304,19 @@ def eventually(condition, timeout=10, what="the condition"):
         time.sleep(0.01)
         last, looked = looked, time.monotonic()
         left -= min(looked - last, 0.1)
+
+
+def stop_process(pid):
+    """Stops a process; returns when none of its threads runs any more. The kernel stops them one after the other, later."""
+    def runs():
+        for path in pathlib.Path(f"/proc/{pid}/task").glob("*/stat"):
+            with contextlib.suppress(FileNotFoundError, ProcessLookupError):  # a thread that has ended
+                if path.read_text().rsplit(")", 1)[1].split()[0] not in "TtZX":
+                    return True
+        return False
+
+    os.kill(pid, signal.SIGSTOP)
+    eventually(lambda: not runs(), what="the stop of every thread")
 
 
 class Standstills:

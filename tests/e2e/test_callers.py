@@ -19,7 +19,8 @@ import unittest
 
 import harness
 import wire
-from harness import BUILD, ERROR, SOCKET, Daemon, Logs, as_account, entitle, eventually, in_a_new_process, refused_with
+from harness import (BUILD, ERROR, SOCKET, Daemon, Logs, as_account, entitle, eventually, in_a_new_process, refused_with,
+                     stop_process)
 
 PROGRAM = "brenvik-caller-worker"
 CALLERS = pathlib.Path(f"{SOCKET}.callers")
@@ -268,7 +269,7 @@ class Callers(unittest.TestCase):
         service = self.service()
         self.daemon()
         with contextlib.closing(wire.Client()):
-            os.kill(service.worker(), signal.SIGSTOP)
+            stop_process(service.worker())
             began = time.monotonic()
             self.assertEqual(in_a_new_process(), 35)
             self.assertGreater(time.monotonic() - began, 1.9)

@@ -13,7 +13,7 @@ import time
 import traceback
 
 import wire
-from harness import ERROR, HelperTest, as_account, eventually, main, refused_with
+from harness import ERROR, HelperTest, as_account, eventually, main, refused_with, stop_process
 
 LONGEST_CALL = 0.1  # seconds, of a client that is checked in, while others do what they like
 CHECK_IN_REFUSED = "out of descriptors or memory: a check-in was refused"
@@ -92,7 +92,7 @@ class Attack:
 
     def __init__(self, test, account, work):
         done, tell = os.pipe()
-        os.kill(test.daemon.pid, signal.SIGSTOP)
+        stop_process(test.daemon.pid)
         self.pid = os.fork()
         if self.pid == 0:
             try:

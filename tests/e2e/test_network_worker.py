@@ -9,7 +9,7 @@ import re
 import signal
 import time
 
-from harness import ERROR, LOG_ERR, SANITIZED, HelperTest, as_account, eventually, main
+from harness import ERROR, LOG_ERR, SANITIZED, HelperTest, as_account, eventually, main, stop_process
 from intrusion import tell_ways_into
 from test_lasd import ALL, DIRECTORY, HOST, UpdateTest, request_check
 from test_location import Brenvik, LocationTest, civic
@@ -32,17 +32,16 @@ def ping(client):
 class WorkerTest:
     """For tests that kill the worker."""
 
-    def kill(self, how=signal.SIGKILL):
+    def kill(self):
         """False when there is none."""
         worker = self.daemon.network_worker()
         if worker is None:
             return False
         try:
-            os.kill(worker, how)
+            os.kill(worker, signal.SIGKILL)
         except ProcessLookupError:
             return False
-        if how == signal.SIGKILL:  # what is asked of one that is still going is lost with it
-            eventually(lambda: has_ended(worker))
+        eventually(lambda: has_ended(worker))  # what is asked of one that is still going is lost with it
         return True
 
     def status(self):
@@ -198,8 +197,7 @@ class Location(WorkerTest, LocationTest):
         count = self.ask(client, brenvik)
         brenvik.wait_for(count + 1)
         worker = self.daemon.network_worker()
-        self.assertTrue(self.kill(signal.SIGSTOP))
-        self.addCleanup(lambda: pathlib.Path(f"/proc/{worker}").exists() and os.kill(worker, signal.SIGKILL))
+        stop_process(worker)
         count = self.ask(client, brenvik)
         longest = 0.0
         while len(brenvik.pushes) == count:

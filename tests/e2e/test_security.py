@@ -20,7 +20,7 @@ import unittest
 
 import wire
 from harness import (ALLOW, BUILD, DEFAULT, ENTITLEMENTS, ERROR, INFO, LOG_ERR, SANITIZED, SOCKET, Daemon, HelperTest,
-                     as_account, entitle, eventually, in_a_new_process, main, refused_with)
+                     as_account, entitle, eventually, in_a_new_process, main, refused_with, stop_process)
 
 SYSTEM_BUS = pathlib.Path("/run/dbus/system_bus_socket")
 HOSTED = "libbrenvik-baseband-helper.so.0"
@@ -233,7 +233,7 @@ class Attacks(Besieged):
                 "os.dup2(service.fileno(), 9)\n"
                 "print('sent', flush=True)\n"
                 f"os.execv({self.PYTHON!r}, ['python3', '-c', {reply!r}])\n")
-        self.daemon.process.send_signal(signal.SIGSTOP)
+        stop_process(self.daemon.pid)
         try:
             attack = subprocess.Popen([str(plain), "-c", code], stdout=subprocess.PIPE, cwd="/", user=self.STRANGER.pw_uid,
                                       group=self.STRANGER.pw_gid, extra_groups=[])

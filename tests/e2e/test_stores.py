@@ -16,7 +16,7 @@ import threading
 import time
 
 import wire
-from harness import BUILD, ERROR, HelperTest, as_account, eventually, listen, main
+from harness import BUILD, ERROR, HelperTest, as_account, eventually, listen, main, stop_process
 from intrusion import tell_ways_into, ways_into
 
 HOME = pathlib.Path("/var/mobile")
@@ -387,10 +387,10 @@ class Worker(StoresTest):
         self.set_token()
         for use, seconds in ((self.token, 2.5), (self.remap, 4)):
             worker, = self.workers()
-            os.kill(worker, signal.SIGSTOP)
+            stop_process(worker)
             with self.within(seconds):
                 use()
-            self.assertNotIn(worker, self.workers())
+            eventually(lambda: worker not in self.workers(), what="its end")
             self.assertEqual(self.token(), "token")
         self.logs.wait_for("unified", ERROR, f"{WORKER} does not answer as it should, and is ended")
         self.logs.wait_for("unified", ERROR, READ)
@@ -465,7 +465,7 @@ class Service(StoresTest):
     def test_stopped_by_its_account_it_costs_each_request_its_time_and_no_more(self):
         self.set_token()
         other = self.client()
-        self.as_mobile(lambda: os.kill(self.worker.pid, signal.SIGSTOP))
+        self.as_mobile(lambda: stop_process(self.worker.pid))
         for _ in range(3):
             with self.within(2.5):
                 self.assertEqual(self.token(), "")
