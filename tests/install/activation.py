@@ -31,6 +31,9 @@ WORKER = pathlib.Path("/lib/systemd/system/brenvik-caller-worker.service")
 SERVICE_PATH = "/run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper"
 PEER = "systemd-hostnamed.service"
 MOST_OF_PEER = 0.45
+# Seconds after each. A service that leaves when idle is started on a machine that has rested, ten seconds later at the earliest;
+# and what the kernel takes down afterwards (namespaces, control groups) is not to be measured.
+REST = 0.3
 # These go together: without them the service manager takes the whole machine's tree, and changes that.
 A_ROOT_OF_ITS_OWN = ("RootDirectory", "BindReadOnlyPaths", "BindPaths")
 # What makes the service start at all; the rest is the sandbox.
@@ -179,7 +182,7 @@ def main():
                 process = run("systemctl", "show", "-P", "MainPID", each.unit).strip()
                 each.processor.append(int(pathlib.Path(f"/proc/{process}/schedstat").read_text().split()[0]) / 1e9)
             run("systemctl", "stop", each.unit)
-            time.sleep(0.03)  # what the kernel takes down afterwards (namespaces, control groups) is not to be measured
+            time.sleep(REST)
 
     floor = statistics.median(all_of_them[0].times)
     installed = statistics.median(all_of_them[1].times)

@@ -638,8 +638,9 @@ def expect_refused(found, **wanted):
         expect_equal(found[key], error, key)
 
 
-# Nothing of another process can be had, and no file system setting changed.
-OF_OTHERS = {"vm_write": "EPERM", "vm_read": "EPERM", "ptrace": "EPERM", "take_descriptor": "EPERM", "settings": "ENOENT"}
+# Nothing of another process can be had, and nothing of the kernel's own: its settings, its log, its symbols, its name.
+OF_OTHERS = {"vm_write": "EPERM", "vm_read": "EPERM", "ptrace": "EPERM", "take_descriptor": "EPERM", "settings": "ENOENT",
+             "kernel_log": "EPERM", "kernel_log_file": "ENOENT", "kernel_log_device": "ENOENT", "symbols": "ENOENT", "host_name": "EPERM"}
 NO_NETWORK = {"inet": "EAFNOSUPPORT", "inet6": "EAFNOSUPPORT", "netlink": "EAFNOSUPPORT", "packet": "EAFNOSUPPORT",
               "raw": "no network"}
 

@@ -16,7 +16,8 @@ import sys
 CALLERS = "/run/brenvik/bootstrap/com.norvale.brenvik.mobile-helper.callers"
 LIBC = ctypes.CDLL(None, use_errno=True)
 # Each architecture has numbers of its own for the older system calls.
-PROCESS_VM_READV, PROCESS_VM_WRITEV, PTRACE = {"x86_64": (310, 311, 101), "aarch64": (270, 271, 117)}[os.uname().machine]
+PROCESS_VM_READV, PROCESS_VM_WRITEV, PTRACE, SYSLOG = {"x86_64": (310, 311, 101, 103),
+                                                       "aarch64": (270, 271, 117, 116)}[os.uname().machine]
 PIDFD_OPEN, PIDFD_GETFD = 434, 438
 
 
@@ -106,6 +107,11 @@ def main():
         "root_account": attempt(os.setresuid, 0, 0, 0) if os.geteuid() != 0 else "done",
         "writable": writable_places(),
         "settings": attempt(lambda: os.close(os.open("/proc/sys/kernel/core_pattern", os.O_WRONLY))),
+        "kernel_log": attempt(call, SYSLOG, 10, 0, 0),
+        "kernel_log_file": attempt(lambda: os.close(os.open("/proc/kmsg", os.O_RDONLY))),
+        "kernel_log_device": attempt(lambda: os.close(os.open("/dev/kmsg", os.O_WRONLY))),
+        "symbols": attempt(lambda: os.close(os.open("/proc/kallsyms", os.O_RDONLY))),
+        "host_name": attempt(socket.sethostname, "brenvik-probe"),
     }
     for folder in ("/home", "/root", "/var/mobile", "/run/user", "/tmp"):
         result["sees " + folder] = attempt(lambda: sorted(os.listdir(folder)))

@@ -23,11 +23,8 @@ STORES = "brenvik-store-worker.service"
 CALLERS = "brenvik-caller-worker.service"
 RESTORE = "brenvik-mobile-helper-restore.service"
 # How exposed each may be, in tenths, and at how much its first comment puts it.
-MOST_EXPOSED = {SERVICE: 14, NETWORK: 16, STORES: 9, CALLERS: 12}
-SAID = {SERVICE: 1.3, NETWORK: 1.1, STORES: 0.4, CALLERS: 1.0}
-
-
-@unittest.skipUnless(shutil.which("systemd-analyze"), "systemd-analyze is not installed")
+MOST_EXPOSED = {SERVICE: 16, NETWORK: 16, STORES: 9, CALLERS: 12}
+SAID = {SERVICE: 1.6, NETWORK: 1.1, STORES: 0.4, CALLERS: 1.0}
 
 
 def service_manager():
@@ -35,6 +32,7 @@ def service_manager():
     return int(re.search(r"^systemd_VERSION:\w+=(\d+)", (BUILD / "CMakeCache.txt").read_text(), re.M)[1])
 
 
+@unittest.skipUnless(shutil.which("systemd-analyze"), "systemd-analyze is not installed")
 class Units(unittest.TestCase):
     @classmethod
     def setUpClass(cls):
