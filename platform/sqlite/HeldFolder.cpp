@@ -40,7 +40,7 @@ Way wayOf(const char* path) noexcept {
 // the flag means nothing.
 int openWithoutWaiting(const char* path, int flags, int mode) noexcept {
   const Way way = wayOf(path);
-  return ::openat(way.folder, way.rest, flags | O_NONBLOCK, mode);
+  return ::openat(way.folder, way.rest, flags | O_NONBLOCK, static_cast<mode_t>(mode));
 }
 
 int statFile(const char* path, struct stat* info) noexcept {

@@ -139,7 +139,8 @@ TEST_F(ForeignDatabaseTest, WhatIsTakenFromASchemaIsNotTrustedAndLongTextsAreNot
   EXPECT_EQ(run(database, "ATTACH ':memory:' AS other"), "too many attached databases - max 0");
   EXPECT_EQ(run(database, "PRAGMA writable_schema = ON; DELETE FROM sqlite_master"),
             "table sqlite_master may not be modified");
-  const std::string longStatement = std::string(70'000, ' ') + "SELECT 1";
+  std::string longStatement = "SELECT 1";
+  longStatement.insert(0, 70'000, ' ');
   EXPECT_EQ(run(database, longStatement.c_str()), "string or blob too big");
   (void)::dlclose(library);
 }
