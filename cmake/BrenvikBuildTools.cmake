@@ -6,7 +6,8 @@
 
 # What they need, and no more. Only for BRENVIK_BUILD_TOOLS_ONLY.
 function(brenvik_add_build_tools)
-  foreach(folder platform/base platform/datagram platform/log platform/accounts platform/plist platform/runloop platform/ipc platform/security client tools)
+  foreach(folder platform/base platform/datagram platform/log platform/worker platform/accounts platform/plist platform/runloop
+                 platform/ipc platform/security client tools)
     add_subdirectory(${folder} EXCLUDE_FROM_ALL)
   endforeach()
 endfunction()

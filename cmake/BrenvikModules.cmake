@@ -39,6 +39,16 @@ function(brenvik_view view folder)
   endforeach()
 endfunction()
 
+# Ends the configuration when a library needs one of the project's own that is not part of it: CMake would take the name for one
+# of the system's, and the first missing header would tell.
+function(brenvik_expect_libraries target)
+  foreach(library IN LISTS ARGN)
+    if(library MATCHES "^(platform|helper|tools)_" AND NOT TARGET ${library})
+      message(FATAL_ERROR "${target} needs ${library}, which this build does not have")
+    endif()
+  endforeach()
+endfunction()
+
 # brenvik_library(<target> [DEPENDS <what its headers use>...] [PRIVATE <what only its sources use>...])
 # Takes every .cpp of the folder but *Test.cpp, *Fuzz.cpp and main.cpp; a folder of headers only becomes an
 # INTERFACE library.
@@ -64,6 +74,9 @@ function(brenvik_library target)
     target_include_directories(${target} INTERFACE ${view})
     target_link_libraries(${target} INTERFACE ${ARG_DEPENDS})
   endif()
+  # When all folders have been read.
+  cmake_language(EVAL CODE "cmake_language(DEFER DIRECTORY [[${PROJECT_SOURCE_DIR}]]
+                            CALL brenvik_expect_libraries [[${target}]] ${ARG_DEPENDS} ${ARG_PRIVATE})")
 endfunction()
 
 # brenvik_static_runtime(<program>)
