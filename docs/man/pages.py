@@ -4,6 +4,7 @@
 """Makes the parts of manual pages that come from somewhere else, and the journal's catalogue.
 
 usage: pages.py fill PAGE.scd COMMANDS      the page with its marks replaced; COMMANDS: output of `command-pages man PROGRAM`
+       pages.py finish PAGE                 a page as scdoc writes it, which tells man(1) of the tables in it
        pages.py catalogue                   entries for journalctl -x
        pages.py functions                   names of the C library's functions, one a line
 
@@ -156,10 +157,18 @@ def fill(page, commands):
     return [line for line, before in zip(lines, [None] + lines) if line or before]
 
 
+def finish(page):
+    """The first line names the preprocessors of a page: man-pages(7)."""
+    lines = pathlib.Path(page).read_text().splitlines()
+    return (["'\\\" t"] if ".TS" in lines else []) + lines
+
+
 def main(arguments):
     match arguments:
         case ["fill", page, commands]:
             lines = fill(page, commands)
+        case ["finish", page]:
+            lines = finish(page)
         case ["catalogue"]:
             lines = catalogue()
         case ["functions"]:
