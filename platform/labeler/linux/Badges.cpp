@@ -121,7 +121,7 @@ bool wantsConsonant(std::string_view cluster) noexcept {
 }
 
 // A text of at most a window's size, cluster by cluster. The rules are those of UAX 29 with conjuncts kept
-// whole (GB9c), which libunistring's tables are too old to know: "व्य" is one cluster, not "व्" and "य".
+// whole (GB9c), which libunistring knows since 1.2 and not before: "व्य" is one cluster, not "व्" and "य".
 class Clusters {
  public:
   explicit Clusters(std::string_view text) noexcept : text_(text) {
@@ -132,15 +132,13 @@ class Clusters {
   std::string_view next(std::size_t* parts = nullptr) noexcept {
     const std::size_t start = at_;
     std::size_t count = 0;
-    for (std::size_t partStart = at_;; partStart = at_) {
-      do ++at_;
-      while (at_ < text_.size() && breaks_[at_] == 0);
+    bool joins = true;
+    for (std::size_t partStart = at_; joins; partStart = at_) {
+      do {
+        ++at_;
+        joins = joinsHere(partStart);
+      } while (at_ < text_.size() && breaks_[at_] == 0 && !joins);
       ++count;
-      std::size_t size = 0;
-      if (atEnd() || !wantsConsonant(text_.substr(partStart, at_ - partStart)) ||
-          !isJoiningConsonant(firstCharacter(text_.substr(at_), &size))) {
-        break;
-      }
     }
     if (parts != nullptr) *parts = count;
     return text_.substr(start, at_ - start);
@@ -151,6 +149,13 @@ class Clusters {
  private:
   // Capitals take up to three times the room of the window's letters.
   static constexpr std::size_t kRoom = 4 * kLargestWindow;
+
+  // GB9c holds between the part of a conjunct that starts there and what comes now.
+  bool joinsHere(std::size_t partStart) const noexcept {
+    std::size_t size = 0;
+    return !atEnd() && isJoiningConsonant(firstCharacter(text_.substr(at_), &size)) &&
+           wantsConsonant(text_.substr(partStart, at_ - partStart));
+  }
 
   std::string_view text_;
   std::array<char, kRoom> breaks_;

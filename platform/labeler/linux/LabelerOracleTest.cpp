@@ -81,7 +81,18 @@ class Clusters {
  public:
   Clusters() : iterator_(icu::BreakIterator::createCharacterInstance(icu::Locale::getRoot(), status_)) {}
   std::int32_t count(const std::string& text) {
-    iterator_->setText(icu::UnicodeString::fromUTF8(text));
+    // Some releases of ICU (76) part the flags of regions at each tag, against the rules: a tag extends what
+    // is before it.
+    icu::UnicodeString counted = icu::UnicodeString::fromUTF8(text);
+    for (std::int32_t i = 0; i < counted.length();) {
+      const UChar32 c = counted.char32At(i);
+      if (c >= 0xE0020 && c <= 0xE007F) {
+        counted.remove(i, U16_LENGTH(c));
+      } else {
+        i += U16_LENGTH(c);
+      }
+    }
+    iterator_->setText(counted);
     std::int32_t clusters = 0;
     while (iterator_->next() != icu::BreakIterator::DONE) ++clusters;
     return clusters;

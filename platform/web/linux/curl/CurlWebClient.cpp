@@ -37,6 +37,8 @@ constexpr auto kTimerLeeway = milliseconds(1);
 // Of the TLS library, which libcurl gives out as they are; see x509_vfy.h.
 constexpr long kCertificateNotYetValid = 9;
 constexpr long kCertificateExpired = 10;
+// CURLE_TOO_LARGE, which libcurl has for a header line that is too long since 8.6; see libcurl-errors(3).
+constexpr auto kTooLarge = static_cast<CURLcode>(100);
 
 // Both handles are void to the compiler, so their owners must say what they are.
 struct EasyCleanup {
@@ -529,6 +531,7 @@ class CurlWebClient::Driver : public std::enable_shared_from_this<Driver> {
 
   static WebErrorKind verdict(const Transfer& transfer, CURLcode code) {
     if (transfer.ownVerdict && code != CURLE_OK) return *transfer.ownVerdict;
+    if (code == kTooLarge) return WebErrorKind::malformedResponse;
     switch (code) {
       case CURLE_OK:
         return WebErrorKind::none;
