@@ -192,6 +192,23 @@ class Location(WorkerTest, LocationTest):
         count = self.ask(client, brenvik)
         self.assertEqual(brenvik.wait_for(count + 1)[count][1]["CountryCode"], "FR")
 
+    def test_ten_deaths_in_a_row_keep_nobody_from_anything(self):
+        brenvik, client, other = Brenvik(self), self.client(), self.client()
+        machine, workers = self.watch_machine(), set()
+        for _ in range(10):
+            count = self.ask(client, brenvik)
+            self.assertEqual(brenvik.wait_for(count + 1)[count][1]["CountryCode"], "FR")
+            workers.add(self.daemon.network_worker())
+            self.assertTrue(self.kill())
+            before = time.monotonic()
+            ping(other)
+            if not SANITIZED:
+                self.assertLess(machine.ran(before), MOST_WAIT)
+            self.assertIsNone(self.daemon.network_worker(), "nobody has a question for one")
+        count = self.ask(client, brenvik)
+        self.assertEqual(brenvik.wait_for(count + 1)[count][1]["CountryCode"], "FR")
+        self.assertEqual(len(workers | {self.daemon.network_worker()}), 11, "a new one each time")
+
     def test_one_that_hangs_costs_its_own_question_the_five_seconds_and_nobody_else_anything(self):
         brenvik, client, other = Brenvik(self), self.client(), self.client()
         count = self.ask(client, brenvik)
