@@ -385,7 +385,7 @@ class Standstills:
         if daemon is not None:
             tasks.append(f"/proc/{daemon.pid}")
         for task in tasks:
-            with contextlib.suppress(OSError):  # a thread that has ended, or a kernel that does not count
+            with contextlib.suppress(OSError, IndexError):  # a thread that has ended, or a kernel that does not count
                 waited = int(pathlib.Path(f"{task}/schedstat").read_text().split()[1]) / 1e9
                 self.waited += max(waited - self.known.get(task, waited), 0)
                 self.known[task] = waited
