@@ -136,9 +136,13 @@ int runComposed(const HelperPlatform& platform, const HelperState& state) {
     serving = std::make_unique<Serving>(platform, state);
     return &serving->areas();
   });
-  Telling telling(platform, state, [&serving] {
-    return serving != nullptr ? serving->workers()
-                              : std::vector<StatusReport::Worker>{{"network"}, {"stores"}};
+  Telling telling(platform, state, [&platform, &serving] {
+    auto workers = platform.checkInWorkers ? platform.checkInWorkers() : std::vector<StatusReport::Worker>();
+    for (auto& each : serving != nullptr ? serving->workers()
+                                         : std::vector<StatusReport::Worker>{{"network"}, {"stores"}}) {
+      workers.push_back(std::move(each));
+    }
+    return workers;
   });
   const ServerPlatform server{
       .ports = platform.ports,

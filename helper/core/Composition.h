@@ -74,7 +74,6 @@ class RequestPlatform {
 struct HelperPlatform {
   RunLoop& loop;
   WorkQueues& queues;
-  AccountDirectory& accounts;
   TaskSecurity& security;
   PortSpace& ports;
   RegionAllocator& regions;
@@ -82,6 +81,8 @@ struct HelperPlatform {
   Bootstrap& bootstrap;
   BasebandLibrary& baseband;
   ServiceManager& serviceManager;
+  // The worker processes that check-ins need, and whether each runs now. Main loop only. May be empty.
+  std::function<std::vector<StatusReport::Worker>()> checkInWorkers = {};
   // Makes the rest at the first request. Throws std::bad_alloc; the next request then calls it again.
   std::function<std::unique_ptr<RequestPlatform>(MobileUser& mobile)> makeRequestPlatform;
   // Begins to answer those who ask for the report, until the result is destroyed. The result may be null. May

@@ -176,7 +176,6 @@ int run() {
   const HelperPlatform platform{
       .loop = *loop,
       .queues = queues,
-      .accounts = accounts,
       .security = security,
       .ports = ports,
       .regions = regions,
@@ -184,6 +183,13 @@ int run() {
       .bootstrap = bootstrap,
       .baseband = baseband,
       .serviceManager = serviceManager,
+      .checkInWorkers =
+          [&callerWorker] {
+            // One that is never asked would look like one that is missing.
+            return readsCallersByItself()
+                       ? std::vector<StatusReport::Worker>()
+                       : std::vector<StatusReport::Worker>{{"callers", callerWorker.isRunning()}};
+          },
       .makeRequestPlatform =
           [&queues](MobileUser& mobile) { return std::make_unique<LinuxRequestPlatform>(queues, mobile); },
       .serveStatus =

@@ -5,6 +5,7 @@
 Every test runs as root in a machine of its own (see the sandbox script): it may write entitlements, become
 another account and stop the daemon it started.
 """
+import bisect
 import contextlib
 import grp
 import os
@@ -319,10 +320,31 @@ def stop_process(pid):
     eventually(lambda: not runs(), what="the stop of every thread")
 
 
+def kill_process(pid):
+    """Kills a process of anybody's; returns when its last thread has ended, and with it closed what the process held.
+
+    Its state is no sign of that: a process is a zombie as soon as its first thread has ended. False when there is none.
+    """
+    try:
+        process = os.pidfd_open(pid)
+    except ProcessLookupError:
+        return False
+    try:
+        with contextlib.suppress(ProcessLookupError):
+            signal.pidfd_send_signal(process, signal.SIGKILL)
+        if not select.select([process], [], [], 20)[0]:
+            raise AssertionError(f"process {pid} does not end")
+    finally:
+        os.close(process)
+    return True
+
+
 class Standstills:
     """Watches for moments in which the machine lets nobody run, so that a limit of time can leave them out.
 
-    A thread on each processor sleeps for a moment, over and over. Where it oversleeps, the processor stood still.
+    A thread on each processor sleeps for a moment, over and over. Where it oversleeps, the processor stood still. The
+    first of them also adds up how long the daemon's main thread and the threads of this process waited for a processor
+    that somebody else had, as the scheduler counts it.
     """
 
     MOMENT = 0.01
@@ -330,7 +352,8 @@ class Standstills:
     LONG = 0.05  # more than a busy machine lets somebody wait who hardly ever wants to run
 
     def __init__(self, test):
-        self.gaps, self.ended = [], False
+        self.test, self.gaps, self.ended = test, [], False
+        self.waited, self.known, self.waits = 0.0, {}, []  # seconds; what each thread had waited; [(time, seconds)]
         self.threads = [threading.Thread(target=self._watch, args=(cpu,), daemon=True)
                         for cpu in sorted(os.sched_getaffinity(0))[:self.MOST]]
         self.seen = {}  # until when each thread has looked
@@ -351,7 +374,29 @@ class Standstills:
             time.sleep(self.MOMENT)
             if (woke := time.monotonic()) - slept > self.LONG:
                 self.gaps.append((slept, woke))
+            if threading.current_thread() is self.threads[0]:
+                self._add_waits()
             self.seen[cpu] = woke
+
+    def _add_waits(self):
+        watchers = {str(thread.native_id) for thread in self.threads}
+        tasks = [f"/proc/self/task/{task}" for task in os.listdir("/proc/self/task") if task not in watchers]
+        daemon = getattr(self.test, "daemon", None)
+        if daemon is not None:
+            tasks.append(f"/proc/{daemon.pid}")
+        for task in tasks:
+            with contextlib.suppress(OSError, IndexError):  # a thread that has ended, or a kernel that does not count
+                waited = int(pathlib.Path(f"{task}/schedstat").read_text().split()[1]) / 1e9
+                self.waited += max(waited - self.known.get(task, waited), 0)
+                self.known[task] = waited
+        self.waits.append((time.monotonic(), self.waited))
+
+    def _waited_until(self, moment):
+        at = bisect.bisect(self.waits, (moment,))
+        if at in (0, len(self.waits)):
+            return self.waits[min(at, len(self.waits) - 1)][1]
+        (before, low), (after, high) = self.waits[at - 1:at + 1]
+        return low + (high - low) * (moment - before) / (after - before)
 
     def count(self, start, end):
         """How often a processor stood still between two moments of time.monotonic()."""
@@ -370,9 +415,10 @@ class Standstills:
         return seconds
 
     def ran(self, start, end=None):
-        """Seconds from `start` to `end`, or until now, in which the machine ran."""
+        """Seconds from `start` to `end`, or until now, in which the machine ran, and had a processor for us and the daemon."""
         end = end or time.monotonic()
-        return end - start - self.between(start, end)
+        stood = self.between(start, end)
+        return end - start - max(stood, min(self._waited_until(end) - self._waited_until(start), end - start))
 
 
 class HelperTest(unittest.TestCase):

@@ -3,6 +3,7 @@
 """A helper without CAP_SYS_PTRACE, as its unit has it: a worker tells it which programs its callers run."""
 import array
 import contextlib
+import json
 import os
 import pathlib
 import re
@@ -207,6 +208,23 @@ class Callers(unittest.TestCase):
         done = subprocess.run(["unshare", "--user", "--map-root-user", sys.executable, "-c", code], check=False)
         self.assertEqual(done.returncode, 35)
 
+    def test_the_status_tells_whether_the_worker_runs(self):
+        service = self.service()
+        daemon = self.daemon()
+
+        def workers():
+            done = subprocess.run([BUILD / "bvhelperctl", "--json", "status"], capture_output=True, check=False, timeout=60)
+            return json.loads(done.stdout).get("workers")  # none while the status socket is not there yet
+        others = [{"name": "network", "running": False}, {"name": "stores", "running": False}]
+        for runs in (False, True):
+            wanted = [{"name": "callers", "running": runs}, *others]
+            eventually(lambda: workers() == wanted, what=f"a status that says {wanted}")
+            self.assertEqual(in_a_new_process(), 0)
+        service.worker()
+        service.kill()
+        self.assertEqual(workers(), [{"name": "callers", "running": False}, *others])
+        self.assertTrue(daemon.running())
+
     def test_where_nobody_listens_nobody_is_let_in_and_the_log_says_why(self):
         self.daemon()
         self.assertEqual(in_a_new_process(), 35)
@@ -303,7 +321,7 @@ class Callers(unittest.TestCase):
         CALLERS.chmod(0o666)  # the mode is the first lock, and this one the second
 
         def asks():
-            with Question() as question, contextlib.suppress(ConnectionError):
+            with contextlib.suppress(ConnectionError), Question() as question:  # the worker may hang up at any step
                 return 1 if question.about("/proc/self") else 0
             return 0
         self.assertEqual(as_account("mobile", asks), 0)

@@ -12,7 +12,7 @@ import allocations
 import harness
 import tracing
 import wire
-from harness import Daemon, HelperTest, eventually, main
+from harness import Daemon, HelperTest, eventually, main, stop_process
 
 CALLS = 50
 
@@ -61,7 +61,7 @@ class Costs(HelperTest):
         struct.pack_into("<I", message, 8, 0)
 
         def work():
-            self.daemon.process.send_signal(signal.SIGSTOP)
+            stop_process(self.daemon.pid)
             for _ in range(8):
                 self.caller.channel.send(bytes(message))
             self.daemon.process.send_signal(signal.SIGCONT)

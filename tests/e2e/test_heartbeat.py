@@ -154,7 +154,7 @@ class RawSocket(HeartbeatTest):
         for _ in range(5):
             time.sleep(0.5)
             waiting = self.sockets()
-            if time.monotonic() - second < 0.9:
+            if time.monotonic() - second < 0.7:
                 break
             second, packet = skipped_replies()
         self.assertEqual(waiting, 1, "still waiting")

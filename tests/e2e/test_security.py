@@ -373,7 +373,9 @@ class Refusals(HelperTest):
 class Access(HelperTest):
     """bvhelperctl explains the very decision that the helper makes."""
 
-    def prepare(self):
+    def setUp(self):
+        super().setUp()
+        self.client()  # the helper does not leave, however long a step takes
         (ENTITLEMENTS / "50-test.plist").unlink()
 
     def tearDown(self):

@@ -16,7 +16,7 @@ import threading
 import time
 
 import wire
-from harness import BUILD, ERROR, HelperTest, as_account, eventually, listen, main, stop_process
+from harness import BUILD, ERROR, HelperTest, as_account, eventually, kill_process, listen, main, stop_process
 from intrusion import tell_ways_into, ways_into
 
 HOME = pathlib.Path("/var/mobile")
@@ -374,8 +374,7 @@ class Worker(StoresTest):
         other = self.client()
         for _ in range(10):
             worker, = self.workers()
-            os.kill(worker, signal.SIGKILL)
-            eventually(lambda: self.status(worker).get("State", "Z")[0] == "Z", what="its end")
+            self.assertTrue(kill_process(worker))
             with self.within(1):
                 self.assertEqual(self.token(), "token")
             with self.within(0.1):

@@ -833,6 +833,8 @@ def tells_what_keeps_it():
     told = json.loads(bvhelperctl("--json", "status").stdout)
     expect_equal(told["pid"], int(property_of(SERVICE, "MainPID")))
     expect_equal((told["version"], told["restartPending"]), (told["installed"], False))
+    expect_equal({each["name"]: each["running"] for each in told["workers"]},
+                 {"callers": True, "network": False, "stores": False})
     wait_for(lambda: property_of(SERVICE, "StatusText") == "Idle, leaves soon", "the line of systemctl status")
 
 

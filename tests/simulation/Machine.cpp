@@ -179,7 +179,6 @@ void Machine::live() {
   const HelperPlatform platform{
       .loop = life_->loop,
       .queues = life_->queues,
-      .accounts = accounts_,
       .security = security_,
       .ports = life_->ports,
       .regions = life_->regions,

@@ -569,8 +569,8 @@ class Status(ToolTest):
     def test_all_that_a_helper_tells_is_shown(self):
         told = self.text("executable=/none", "socket=/run/service", "busy=database-check 2", "busy=heartbeat 1",
                          "heartbeat=yes", "heartbeat-sent=1 40", "heartbeat-received=0 0", "database=gsm updated 3000",
-                         "database=umts checking 100", "location-answer=timed-out 7300000", "worker=network running",
-                         "worker=stores stopped", "a-newer-key=x", **{"busy-tokens": 3, "clients": 2})
+                         "database=umts checking 100", "location-answer=timed-out 7300000", "worker=callers running",
+                         "worker=network running", "worker=stores stopped", "a-newer-key=x", **{"busy-tokens": 3, "clients": 2})
         self.answer(told, told)
         out, err = self.run_tool("status")
         lines = out.splitlines()
@@ -580,8 +580,8 @@ class Status(ToolTest):
             "held by       2 clients, a database check, the heartbeat", "busy tokens   3",
             "heartbeat     on, 1 packet (40 bytes) sent, 0 packets (0 bytes) received",
             "databases     gsm: updated, 3 s ago", "              umts: checking, since 0 s",
-            "location      last request timed out, 2 h ago", "workers       network: running",
-            "              stores: not running"])
+            "location      last request timed out, 2 h ago", "workers       callers: running",
+            "              network: running", "              stores: not running"])
         self.assertEqual(err, "")
         answer = self.json("status")
         self.assertEqual((answer["version"], answer["installed"], answer["restartPending"]), ("0.1.0", None, False))
@@ -591,7 +591,8 @@ class Status(ToolTest):
         self.assertEqual([(each["type"], each["outcome"], each["age"]) for each in answer["databases"]],
                          [("gsm", "updated", 3.0), ("umts", "checking", 0.1)])
         self.assertEqual(answer["locationAnswer"], {"outcome": "timed-out", "age": 7300.0})
-        self.assertEqual(answer["workers"], [{"name": "network", "running": True}, {"name": "stores", "running": False}])
+        self.assertEqual(answer["workers"], [{"name": "callers", "running": True}, {"name": "network", "running": True},
+                                             {"name": "stores", "running": False}])
 
     def test_an_idle_helper_says_when_it_leaves(self):
         self.answer(self.text("leaves-in-ms=6001"), self.text("leaves-in-ms=6001", "kept-by-baseband=yes"))

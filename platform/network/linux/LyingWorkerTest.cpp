@@ -79,9 +79,10 @@ class LyingWorkerTest : public testing::Test {
     lie = [make](WorkerChannel& channel) { EXPECT_EQ(channel.send(make()), WorkerResult::done); };
   }
 
-  std::shared_ptr<WebResponse> fetch(std::uint64_t largest = 100) {
+  std::shared_ptr<WebResponse> fetch(std::uint64_t largest = 100) { return fetchBy(web, largest); }
+  std::shared_ptr<WebResponse> fetchBy(RemoteWebClient& client, std::uint64_t largest = 100) {
     std::promise<std::shared_ptr<WebResponse>> answer;
-    const auto request = web.makeRequest(WebRequestType::get, "https://host/", {}, web.makeSession());
+    const auto request = client.makeRequest(WebRequestType::get, "https://host/", {}, client.makeSession());
     request->setCallbackQueue(callbacks);
     request->setLargestBody(largest);
     request->setCompletion(
@@ -97,8 +98,9 @@ class LyingWorkerTest : public testing::Test {
             nullptr, callbacks);
     return answer.get_future().get();
   }
-  GunzipResult unpack() {
-    return gunzip.gunzipInto({std::as_bytes(std::span("gzip", 4))}, file.get(), 10, 10).result;
+  GunzipResult unpack() { return unpackBy(gunzip); }
+  GunzipResult unpackBy(RemoteGunzip& by) {
+    return by.gunzipInto({std::as_bytes(std::span("gzip", 4))}, file.get(), 10, 10).result;
   }
   // Nonsense costs the worker its life, once, and nobody else anything.
   void expectGivenUp(int times) {
@@ -209,15 +211,21 @@ TEST_F(LyingWorkerTest, AWorkerThatHangsUpIsGivenUpAtOnce) {
 }
 
 TEST_F(LyingWorkerTest, SignsOfLifeKeepARequestAndAFloodOfThemDoesNot) {
-  lie = [](WorkerChannel& channel) {
-    for (int i = 0; i < 6; ++i) {
-      std::this_thread::sleep_for(kSilence / 3);
-      if (channel.send({kAlive, {}, {}}) != WorkerResult::done) return;
-    }
-    (void)channel.send(packLarge(kAnswer, encode(WebAnswer{WebErrorKind::none, 204, {}, 0})));
-  };
-  EXPECT_EQ(fetch()->statusCode, 204);
-  expectGivenUp(0);
+  {
+    static constexpr auto kPatience =
+        1000ms;  // a sign of life may come late where others have the processors
+    NetworkAnswers patient(queues, worker, kPatience);
+    RemoteWebClient client(patient);
+    lie = [](WorkerChannel& channel) {
+      for (int i = 0; i < 12; ++i) {
+        std::this_thread::sleep_for(kPatience / 10);
+        if (channel.send({kAlive, {}, {}}) != WorkerResult::done) return;
+      }
+      (void)channel.send(packLarge(kAnswer, encode(WebAnswer{WebErrorKind::none, 204, {}, 0})));
+    };
+    EXPECT_EQ(fetchBy(client)->statusCode, 204);
+    expectGivenUp(0);
+  }
   lie = [](WorkerChannel& channel) {
     for (auto sent = WorkerResult::done; sent == WorkerResult::done || sent == WorkerResult::full;)
       sent = channel.send({kAlive, {}, {}});
@@ -234,7 +242,7 @@ TEST_F(LyingWorkerTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
   std::uint32_t kind = 0;
   std::vector<std::byte> payload;
   lie = [&](WorkerChannel& channel) {
-    LingeringSocket lingering(2);
+    LingeringSocket lingering(10);
     WorkerMessage sent{kind, payload, one(std::move(lingering.socket))};
     {
       const std::lock_guard lock(mutex);
@@ -258,22 +266,26 @@ TEST_F(LyingWorkerTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
   EXPECT_EQ(echo.openEchoSocket(1, 1), nullptr);
   expectGivenUp(++times);
   answers.shutDown();
-  EXPECT_LT(Clock::now() - before, 2s) << "each of the thirteen lingers so long";
+  EXPECT_LT(Clock::now() - before, 10s) << "each of the thirteen lingers so long";
 }
 
 TEST_F(LyingWorkerTest, AnUnpackingIsNotKeptByMoreThanAThousandSignsOfLife) {
   int signs = 1000;
   lie = [&signs](WorkerChannel& channel) {
+    const auto send = [&channel](const WorkerMessage& message) {
+      auto sent = WorkerResult::full;  // as long as the reader is slower
+      while (sent == WorkerResult::full) sent = channel.send(message);
+      return sent == WorkerResult::done;
+    };
     for (int i = 0; i < signs; ++i) {
-      auto sent = WorkerResult::full;
-      while (sent == WorkerResult::full) sent = channel.send({kAlive, {}, {}});
-      if (sent != WorkerResult::done) return;
+      if (!send({kAlive, {}, {}})) return;
     }
-    (void)channel.send({kAnswer, encode(GunzipOutcome{GunzipResult::whole, 4, 0}), {}});
+    (void)send({kAnswer, encode(GunzipOutcome{GunzipResult::whole, 4, 0}), {}});
   };
-  EXPECT_EQ(unpack(), GunzipResult::whole);
+  RemoteGunzip patient(worker, 20s);
+  EXPECT_EQ(unpackBy(patient), GunzipResult::whole);
   signs = 1001;
-  EXPECT_EQ(unpack(), GunzipResult::unavailable);
+  EXPECT_EQ(unpackBy(patient), GunzipResult::unavailable);
   expectGivenUp(1);
 }
 

@@ -20,14 +20,14 @@ std::optional<FileIdentity> identityAt(int folder, const char* path) noexcept {
   return FileIdentity{::makedev(facts.stx_dev_major, facts.stx_dev_minor), facts.stx_ino};
 }
 
-std::string executablePathOf(int folder) {
+CallerFacts callerFactsOf(int folder) {
+  CallerFacts facts;
   std::array<char, PATH_MAX> path;
   const ssize_t size = ::readlinkat(folder, "exe", path.data(), path.size());
-  return size > 0 ? std::string(path.data(), static_cast<std::size_t>(size)) : std::string();
-}
-
-CallerFacts callerFactsOf(int folder) {
-  return {identityAt(folder, "exe"), executablePathOf(folder), identityAt(folder, "ns/user")};
+  if (size > 0) facts.executablePath.assign(path.data(), static_cast<std::size_t>(size));
+  facts.executable = identityAt(folder, "exe");
+  facts.userNamespace = identityAt(folder, "ns/user");
+  return facts;
 }
 
 namespace callers {

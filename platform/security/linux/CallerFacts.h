@@ -31,10 +31,8 @@ struct CallerFacts {
   std::optional<FileIdentity> userNamespace;
 };
 
-// The path of the executable of the process whose folder in /proc is open; empty if unknown. Throws
-// std::bad_alloc.
-std::string executablePathOf(int folder);
-// `folder` may be O_PATH. Throws std::bad_alloc.
+// `folder` is the process's open folder in /proc, and may be O_PATH. If something could not be read, errno
+// says why. Throws std::bad_alloc.
 CallerFacts callerFactsOf(int folder);
 
 // The protocol between the helper and the caller worker. One channel serves any number of questions, and

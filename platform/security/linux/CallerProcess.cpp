@@ -84,16 +84,11 @@ std::optional<FileIdentity> CallerProcess::executable() const {
   return told ? told->executable : std::nullopt;
 }
 
-std::string CallerProcess::executablePath() const {
-  if (auto found = executablePathOf(folder_.get()); !found.empty()) return found;
-  auto told = ask();
-  return told ? std::move(told->executablePath) : std::string();
-}
-
-std::optional<FileIdentity> CallerProcess::userNamespace() const {
-  if (const auto found = identityAt(folder_.get(), "ns/user")) return found;
-  const auto told = ask();
-  return told ? told->userNamespace : std::nullopt;
+CallerFacts CallerProcess::facts() const {
+  CallerFacts found = callerFactsOf(folder_.get());
+  if (found.executable && found.userNamespace) return found;
+  auto told = ask();  // errno is still that of whichever was read last in vain
+  return told ? std::move(*told) : found;
 }
 
 std::optional<FileIdentity> CallerProcess::namespaceOfThisProcess(const std::string& proc) {

@@ -36,12 +36,11 @@ class CallerProcess {
 
   // The file that the process executes now; nothing if it has exited, even if it is still a zombie.
   std::optional<FileIdentity> executable() const;
-  // The path of that file according to the kernel; empty if unknown.
-  std::string executablePath() const;
+  // That file, its path and the user namespace, with one question to the reader at most. Nothing of what the
+  // process may not be asked, or has no longer since it exited.
+  CallerFacts facts() const;
   // The unit of the service manager that it runs in; empty if none or unknown.
   std::string unit() const;
-  // Its user namespace; nothing if it has exited or may not be inspected.
-  std::optional<FileIdentity> userNamespace() const;
   static std::optional<FileIdentity> namespaceOfThisProcess(const std::string& proc);
 
  private:

@@ -69,9 +69,11 @@ TEST(CallerProcessTest, ThisProcessIsFoundWithTheFileItExecutes) {
   struct stat facts {};
   ASSERT_EQ(::stat("/proc/self/exe", &facts), 0);
   EXPECT_EQ(process->executable(), (FileIdentity{facts.st_dev, facts.st_ino}));
-  EXPECT_EQ(process->executablePath(), std::filesystem::read_symlink("/proc/self/exe"));
-  EXPECT_TRUE(process->userNamespace());
-  EXPECT_EQ(process->userNamespace(), CallerProcess::namespaceOfThisProcess("/proc"));
+  const CallerFacts known = process->facts();
+  EXPECT_EQ(known.executable, process->executable());
+  EXPECT_EQ(known.executablePath, std::filesystem::read_symlink("/proc/self/exe"));
+  EXPECT_TRUE(known.userNamespace);
+  EXPECT_EQ(known.userNamespace, CallerProcess::namespaceOfThisProcess("/proc"));
 }
 
 TEST(CallerProcessTest, AProcessThatStartedAtAnotherTimeIsNotTheOneWanted) {
@@ -106,8 +108,8 @@ TEST(CallerProcessTest, AProcessThatExitedRunsNoLongerWhetherItsParentKnowsOrNot
 
   ASSERT_EQ(::waitpid(child, nullptr, 0), child);
   EXPECT_FALSE(process->executable()) << "it is gone";
-  EXPECT_EQ(process->executablePath(), "");
-  EXPECT_FALSE(process->userNamespace());
+  EXPECT_EQ(process->facts().executablePath, "");
+  EXPECT_FALSE(process->facts().userNamespace);
   EXPECT_EQ(process->unit(), "");
 }
 

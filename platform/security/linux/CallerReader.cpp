@@ -3,6 +3,9 @@
 #include "platform/security/linux/CallerReader.h"
 
 #include <fcntl.h>
+#include <linux/capability.h>
+#include <sys/syscall.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <new>
@@ -16,6 +19,12 @@ constexpr int kInARow = 3;
 constexpr std::chrono::milliseconds kLeastPatience{10};
 
 }  // namespace
+
+bool readsCallersByItself() noexcept {
+  __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+  __user_cap_data_struct data[_LINUX_CAPABILITY_U32S_3] = {};
+  return ::syscall(SYS_capget, &header, data) == 0 && (data[0].effective & (1U << CAP_SYS_PTRACE)) != 0;
+}
 
 std::optional<CallerFacts> RemoteCallerReader::read(int folder) {
   const auto began = now_();

@@ -13,6 +13,9 @@
 
 namespace brenvik {
 
+// True if this process may read all accounts' processes by itself (CAP_SYS_PTRACE), so that it asks nobody.
+bool readsCallersByItself() noexcept;
+
 // Reads what this process may not read by itself. Any thread.
 class CallerReader {
  public:

@@ -5,11 +5,9 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <limits.h>
-#include <linux/capability.h>
 #include <pthread.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -22,14 +20,13 @@
 
 #include "platform/base/ProcessFacts.h"
 #include "platform/security/linux/CallerProcess.h"
+#include "platform/security/linux/CallerTestSupport.h"
 #include "platform/worker/fakes/ThreadedWorker.h"
 
 namespace brenvik {
 namespace {
 
 constexpr auto kForEver = std::chrono::steady_clock::time_point::max();
-
-CallerFacts someFacts() { return {FileIdentity{1, 2}, "/usr/bin/program", FileIdentity{3, 4}}; }
 
 // Answers each question with the message, until the helper hangs up.
 ThreadedWorker::Serve answering(const std::function<WorkerMessage()>& make) {
@@ -246,36 +243,14 @@ TEST_F(CallerReaderTest, ALackOfMemoryOrDescriptorsIsThisProcesssOwn) {
 
 // ----- A process that may not look at others -----
 
-class AnsweringReader final : public CallerReader {
- public:
-  std::optional<CallerFacts> read(int folder) override {
-    ++asked;
-    struct stat facts {};
-    isFolder = ::fstat(folder, &facts) == 0 && S_ISDIR(facts.st_mode);
-    return answer;
-  }
-  std::optional<CallerFacts> answer = someFacts();
-  int asked = 0;
-  bool isFolder = false;
-};
-
-// The exit status of `work`, run in a child of no capability.
-int withoutCapabilities(const std::function<int()>& work) {
-  const pid_t child = ::fork();
-  if (child == 0) {
-    __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
-    __user_cap_data_struct none[_LINUX_CAPABILITY_U32S_3] = {};
-    ::_exit(::syscall(SYS_capset, &header, none) == 0 ? work() : 99);
-  }
-  int status = 0;
-  if (::waitpid(child, &status, 0) != child || !WIFEXITED(status)) return -1;
-  return WEXITSTATUS(status);
+bool knowsNothing(const CallerProcess& process) {
+  const CallerFacts facts = process.facts();
+  return !facts.executable && !facts.userNamespace && facts.executablePath.empty();
 }
 
-bool isPowerful() {
-  __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
-  __user_cap_data_struct data[_LINUX_CAPABILITY_U32S_3] = {};
-  return ::syscall(SYS_capget, &header, data) == 0 && (data[0].effective & (1U << CAP_SYS_PTRACE)) != 0;
+TEST(CallerProcessWithAReaderTest, ItsCapabilityTellsWhetherAProcessReadsByItself) {
+  EXPECT_EQ(withoutCapabilities([] { return readsCallersByItself() ? 1 : 0; }), 0);
+  EXPECT_TRUE(readsCallersByItself() || ::geteuid() != 0);
 }
 
 TEST(CallerProcessWithAReaderTest, WhatThisProcessMayReadItReadsByItself) {
@@ -283,13 +258,15 @@ TEST(CallerProcessWithAReaderTest, WhatThisProcessMayReadItReadsByItself) {
   const auto self = CallerProcess::pin("/proc", ::getpid(), processStartTime(::getpid()).value(), &reader);
   ASSERT_TRUE(self);
   EXPECT_EQ(self->executable(), identityAt(AT_FDCWD, "/proc/self/exe"));
-  EXPECT_TRUE(self->userNamespace());
-  EXPECT_NE(self->executablePath(), "");
+  const CallerFacts facts = self->facts();
+  EXPECT_EQ(facts.executable, self->executable());
+  EXPECT_EQ(facts.userNamespace, CallerProcess::namespaceOfThisProcess("/proc"));
+  EXPECT_NE(facts.executablePath, "");
   EXPECT_EQ(reader.asked, 0);
 }
 
 TEST(CallerProcessWithAReaderTest, WhatItMayNotReadTheReaderReads) {
-  if (!isPowerful()) GTEST_SKIP() << "a process with fewer rights than this one cannot be made";
+  if (!readsCallersByItself()) GTEST_SKIP() << "a process with fewer rights than this one cannot be made";
   const pid_t powerful = ::getpid();
   const auto startTime = processStartTime(powerful).value();
   EXPECT_EQ(withoutCapabilities([&] {
@@ -298,25 +275,26 @@ TEST(CallerProcessWithAReaderTest, WhatItMayNotReadTheReaderReads) {
               if (!process) return 1;
               if (process->executable() != someFacts().executable || reader.asked != 1 || !reader.isFolder)
                 return 2;
-              if (process->executablePath() != someFacts().executablePath) return 3;
-              if (process->userNamespace() != someFacts().userNamespace) return 4;
+              const CallerFacts facts = process->facts();
+              if (facts.executable != someFacts().executable ||
+                  facts.userNamespace != someFacts().userNamespace ||
+                  facts.executablePath != someFacts().executablePath)
+                return 3;
+              if (reader.asked != 2) return 4;  // one question for all of them
               reader.answer.reset();
-              if (process->executable() || process->userNamespace() || !process->executablePath().empty())
-                return 5;
-              return 0;
+              return process->executable() || !knowsNothing(*process) ? 5 : 0;
             }),
             0);
 }
 
 TEST(CallerProcessWithAReaderTest, WithoutAReaderItKnowsNothing) {
-  if (!isPowerful()) GTEST_SKIP() << "a process with fewer rights than this one cannot be made";
+  if (!readsCallersByItself()) GTEST_SKIP() << "a process with fewer rights than this one cannot be made";
   const pid_t powerful = ::getpid();
   const auto startTime = processStartTime(powerful).value();
   EXPECT_EQ(withoutCapabilities([&] {
               const auto process = CallerProcess::pin("/proc", powerful, startTime);
               if (!process) return 1;
-              if (process->executable() || process->userNamespace()) return 2;
-              return process->executablePath().empty() ? 0 : 3;
+              return process->executable() || !knowsNothing(*process) ? 2 : 0;
             }),
             0);
 }
@@ -334,8 +312,7 @@ TEST(CallerProcessWithAReaderTest, NobodyIsAskedAboutAProcessThatHasGone) {
   ::kill(child, SIGKILL);
   ASSERT_EQ(::waitpid(child, nullptr, 0), child);
   EXPECT_FALSE(process->executable());
-  EXPECT_FALSE(process->userNamespace());
-  EXPECT_EQ(process->executablePath(), "");
+  EXPECT_TRUE(knowsNothing(*process));
   EXPECT_EQ(reader.asked, 0);
 }
 

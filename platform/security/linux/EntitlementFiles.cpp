@@ -11,14 +11,15 @@ namespace brenvik {
 
 class EntitlementFiles::Task final : public SecurityTask, private EntitlementCandidate {
  public:
-  Task(EntitlementSearch& search, CallerProcess process, uid_t uid) noexcept
-      : search_(search), process_(std::move(process)), uid_(uid) {}
+  // `facts` is what the process was when the task was made.
+  Task(EntitlementSearch& search, CallerProcess process, CallerFacts facts, uid_t uid) noexcept
+      : search_(search), process_(std::move(process)), facts_(std::move(facts)), uid_(uid) {}
 
   Answer copyEntitlement(std::string_view name) noexcept override try {
     EntitlementSearch::Result result = search_.find(name, *this);
     // Last, so that whatever was read was read while the caller was there: a process that has gone holds
     // nothing, and one that has become another program holds what that one does.
-    if (result.value && process_.executable() != executable_) return {};
+    if (result.value && process_.executable() != facts_.executable) return {};
     return {std::move(result.value), result.error};
   } catch (...) {
     return {{}, true};  // out of memory
@@ -28,7 +29,7 @@ class EntitlementFiles::Task final : public SecurityTask, private EntitlementCan
     std::vector<EntitlementFinding> findings;
     const EntitlementSearch::Result result = search_.find(name, *this, &findings);
     // Whatever the files said, it was not of this program.
-    if (!process_.executable() || process_.executable() != executable()) {
+    if (const auto now = process_.executable(); !now || now != facts_.executable) {
       return "the caller has ended, or has become another program";
     }
     return whyNotEntitled(result, findings);
@@ -36,14 +37,11 @@ class EntitlementFiles::Task final : public SecurityTask, private EntitlementCan
     return {};  // out of memory
   }
 
-  Caller describeCaller() const override { return {process_.executablePath(), process_.unit()}; }
+  Caller describeCaller() const override { return {facts_.executablePath, process_.unit()}; }
 
  private:
   uid_t uid() const noexcept override { return uid_; }
-  const std::optional<FileIdentity>& executable() override {
-    if (!executable_) executable_ = process_.executable();
-    return executable_;
-  }
+  const std::optional<FileIdentity>& executable() override { return facts_.executable; }
   const std::string& unit() override {
     if (!unit_) unit_ = process_.unit();
     return *unit_;
@@ -51,9 +49,9 @@ class EntitlementFiles::Task final : public SecurityTask, private EntitlementCan
 
   EntitlementSearch& search_;
   const CallerProcess process_;
+  const CallerFacts facts_;
   const uid_t uid_;
-  std::optional<FileIdentity> executable_;  // asked for once
-  std::optional<std::string> unit_;         // the same
+  std::optional<std::string> unit_;  // asked for once
 };
 
 EntitlementFiles::EntitlementFiles(AccountDirectory& accounts, CallerReader* reader)
@@ -65,8 +63,10 @@ EntitlementFiles::EntitlementFiles(AccountDirectory& accounts, std::vector<std::
 
 std::unique_ptr<SecurityTask> EntitlementFiles::makeTask(const AuditToken& caller) noexcept try {
   auto process = CallerProcess::pin(proc_, caller.pid(), caller.pidVersion(), reader_);
-  if (!process || !isInOurNamespace(*process)) return nullptr;
-  return std::make_unique<Task>(search_, std::move(*process), caller.uid());
+  if (!process) return nullptr;
+  CallerFacts facts = process->facts();
+  if (!isInOurNamespace(facts)) return nullptr;
+  return std::make_unique<Task>(search_, std::move(*process), std::move(facts), caller.uid());
 } catch (...) {
   return nullptr;  // out of memory
 }
@@ -74,17 +74,17 @@ std::unique_ptr<SecurityTask> EntitlementFiles::makeTask(const AuditToken& calle
 std::string EntitlementFiles::explainNoTask(const AuditToken& caller) noexcept try {
   const auto process = CallerProcess::pin(proc_, caller.pid(), caller.pidVersion(), reader_);
   if (!process) return "the caller has ended";
-  if (!process->userNamespace()) return "the caller's user namespace cannot be told";
-  return isInOurNamespace(*process) ? "the caller cannot be examined now"
-                                    : "the caller is in a user namespace of its own";
+  const CallerFacts facts = process->facts();
+  if (!facts.userNamespace) return "the caller's user namespace cannot be told";
+  return isInOurNamespace(facts) ? "the caller cannot be examined now"
+                                 : "the caller is in a user namespace of its own";
 } catch (...) {
   return {};  // out of memory
 }
 
 // Whoever makes a user namespace is root in it, of mounts among others.
-bool EntitlementFiles::isInOurNamespace(const CallerProcess& process) const {
-  const auto its = process.userNamespace();
-  return its && its == CallerProcess::namespaceOfThisProcess(proc_);
+bool EntitlementFiles::isInOurNamespace(const CallerFacts& caller) const {
+  return caller.userNamespace && caller.userNamespace == CallerProcess::namespaceOfThisProcess(proc_);
 }
 
 }  // namespace brenvik

@@ -29,7 +29,7 @@ class EntitlementFiles final : public TaskSecurity {
 
  private:
   class Task;
-  bool isInOurNamespace(const CallerProcess& process) const;
+  bool isInOurNamespace(const CallerFacts& caller) const;
 
   EntitlementSearch search_;
   const std::string proc_;

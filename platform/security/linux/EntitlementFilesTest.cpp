@@ -30,6 +30,7 @@
 #include "platform/log/Log.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/plist/PropertyListCodec.h"
+#include "platform/security/linux/CallerTestSupport.h"
 #include "platform/security/linux/Sha256.h"
 
 // Calls of this program that a test may let fail. None of the opens here makes a file. Only the symbols have
@@ -205,6 +206,32 @@ class EntitlementFilesTest : public testing::Test {
   FakeAccountDirectory accounts;
   RecordingLog log;
 };
+
+TEST_F(EntitlementFilesTest, ACallerThatOnlyTheReaderMayReadCostsTwoQuestions) {
+  if (!readsCallersByItself()) GTEST_SKIP() << "a process with fewer rights than this one cannot be made";
+  grant("etc/a.plist");
+  const Child caller(program);
+  const UniqueFd folder(
+      ::open(("/proc/" + std::to_string(caller.token().pid())).c_str(), O_PATH | O_CLOEXEC));
+  ASSERT_EQ(::chmod(root.c_str(), 0755), 0);  // the child has no power over modes
+  AnsweringReader reader;
+  reader.answer = callerFactsOf(folder.get());
+  const auto outcome = [&](int questions, bool isEntitled) {
+    return withoutCapabilities([&] {
+      EntitlementFiles files(accounts, {(root / "etc").string()}, "/proc", &reader);
+      const auto task = files.makeTask(caller.token());
+      if (task == nullptr) return 1;
+      if (task->describeCaller().executable != program) return 2;
+      const auto answer = task->copyEntitlement(kName);
+      if (answer.error || (answer.value.asBoolean() == true) != isEntitled) return 3;
+      if (!isEntitled && task->explainRefusal(kName).empty()) return 4;
+      return reader.asked == questions ? 0 : 10 + reader.asked;
+    });
+  };
+  EXPECT_EQ(outcome(2, true), 0) << "what it is, and whether it still is when all has been read";
+  fs::remove(root / "etc/a.plist");
+  EXPECT_EQ(outcome(2, false), 0);
+}
 
 TEST_F(EntitlementFilesTest, AFileOfTheCallersProgramGivesTheValue) {
   grant("etc/a.plist");
