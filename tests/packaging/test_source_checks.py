@@ -111,7 +111,9 @@ class Checks(unittest.TestCase):
         self.write("platform/a/A.cpp", LICENCE + "".join(f"namespace n{i} {{ {COMPLEX.format(name='tangled')} }}\n" for i in range(2)))
         self.assertIn("above the limit", self.complaints("check-code", "--all"))
         self.write("platform/a/A.cpp", LICENCE + "int tangled(int a) { return a; }\n")
-        self.assertIn("tangled of platform/a/A.cpp is no longer above the limit: remove its line", self.complaints("check-code", "--all"))
+        if shutil.which("clang-tidy-14"):  # which alone says so: the list is made with it, and each version counts differently
+            self.assertIn("tangled of platform/a/A.cpp is no longer above the limit: remove its line",
+                          self.complaints("check-code", "--all"))
         # What is not compiled as it stands is not passed over.
         self.write("platform/a/A.cpp", LICENCE + "#include <none.h>\n")
         self.assertIn("could not be read", self.complaints("check-code", "--all"))
