@@ -16,12 +16,17 @@ if(NOT BRENVIK_CLIENT_ONLY)
 endif()
 if(BUILD_TESTING)
   find_package(GTest REQUIRED)
+  # When it optimises the long functions of tests, g++ (14) sees strings and vectors left that are not. In the sources it
+  # does not, so these keep the warning.
+  add_library(brenvik_test_flags INTERFACE)
+  target_compile_options(brenvik_test_flags INTERFACE
+    $<$<AND:$<CXX_COMPILER_ID:GNU>,$<NOT:$<CONFIG:Debug>>>:-Wno-array-bounds>)
   # The test framework's headers are the larger part of what a test costs to compile, so they are compiled once.
   # Tests only: the sources themselves name what they include.
   # A program, as the tests are, for the flags must agree.
   file(CONFIGURE OUTPUT ${PROJECT_BINARY_DIR}/TestPrecompiled.cpp CONTENT "int main() {}\n")
   add_executable(brenvik_test_precompiled EXCLUDE_FROM_ALL ${PROJECT_BINARY_DIR}/TestPrecompiled.cpp)
-  target_link_libraries(brenvik_test_precompiled PRIVATE brenvik_flags GTest::gmock)
+  target_link_libraries(brenvik_test_precompiled PRIVATE brenvik_flags brenvik_test_flags GTest::gmock)
   target_precompile_headers(brenvik_test_precompiled PRIVATE <gmock/gmock.h> <gtest/gtest.h>
     <array> <chrono> <cstdint> <filesystem> <fstream> <functional> <memory> <optional> <span> <string> <string_view>
     <thread> <vector>)
@@ -104,8 +109,8 @@ function(brenvik_tests target)
   file(GLOB sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*Test.cpp)
   add_executable(${target}_tests ${sources})
   set_target_properties(${target}_tests PROPERTIES RUNTIME_OUTPUT_DIRECTORY ${PROJECT_BINARY_DIR}/unit)
-  target_link_libraries(${target}_tests PRIVATE brenvik_flags brenvik_keep_counts ${target} ${ARG_DEPENDS}
-                                                  GTest::gmock_main Threads::Threads)
+  target_link_libraries(${target}_tests PRIVATE brenvik_flags brenvik_test_flags brenvik_keep_counts ${target}
+                                                  ${ARG_DEPENDS} GTest::gmock_main Threads::Threads)
   target_precompile_headers(${target}_tests REUSE_FROM brenvik_test_precompiled)
   add_test(NAME ${target} COMMAND ${target}_tests)
   # Ends one that hangs; a slow machine with a slow disk and a sanitizer may take minutes, an emulator ten times as long.
