@@ -135,7 +135,7 @@ Values checkedValues(const std::vector<Parameter>& positionals, const std::vecto
   const bool isLiteral = given.has("--literal");
   const char* readAsEmpty = nullptr;
   for (const auto& [name, value] : given.all()) {
-    const auto named = [&name = name](const Parameter& each) { return name == each.name; };
+    const auto named = [&wanted = name](const Parameter& each) { return wanted == each.name; };
     auto parameter = std::find_if(positionals.begin(), positionals.end(), named);
     if (parameter == positionals.end()) parameter = std::find_if(options.begin(), options.end(), named);
     const bool isElsewhere =

@@ -228,26 +228,28 @@ bool Gazetteer::readTables() {
     finish(rows, code);
     return !failure_ && count > 1;
   };
-  auto& [database, land, near, place, countries, layers, rules] = *opened_;
+  auto& countries = opened_->countries;
+  auto& layers = opened_->layers;
+  auto& rules = opened_->rules;
   countries.emplace_back();
   layers.emplace_back();
-  const auto isCountry = [&countries = countries](std::int64_t number) {
+  const auto isCountry = [&countries](std::int64_t number) {
     return number > 0 && number < static_cast<std::int64_t>(countries.size());
   };
-  if (!readAll("select id, code, sovereign from country order by id", [&countries = countries](Query& row) {
+  if (!readAll("select id, code, sovereign from country order by id", [&countries](Query& row) {
         countries.push_back({std::string(row.text(1)), std::string(row.text(2))});
         return countries.size() <= 256;
       })) {
     return false;
   }
-  if (!readAll("select id, country from layer order by id", [&layers = layers, &isCountry](Query& row) {
+  if (!readAll("select id, country from layer order by id", [&layers, &isCountry](Query& row) {
         layers.push_back(static_cast<std::uint8_t>(row.integer(1)));
         return row.integer(1) == 0 || isCountry(row.integer(1));
       })) {
     return false;
   }
   // A table of disputed land may be empty.
-  (void)readAll("select id, country, needs from rule order by id", [&rules = rules, &isCountry](Query& row) {
+  (void)readAll("select id, country, needs from rule order by id", [&rules, &isCountry](Query& row) {
     if (!isCountry(row.integer(1))) return false;
     Rule rule{static_cast<std::uint8_t>(row.integer(1)), {}};
     const auto needs = row.blob(2);
