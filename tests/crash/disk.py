@@ -263,7 +263,10 @@ class Server:
             answer = bytes(80)
         elif kind not in (self.RELEASE, self.FLUSH, self.DESTROY):
             error = errno.ENOSYS
-        os.write(self.fuse, struct.pack("<IiQ", 16 + len(answer), -error, unique) + answer)
+        try:
+            os.write(self.fuse, struct.pack("<IiQ", 16 + len(answer), -error, unique) + answer)
+        except FileNotFoundError:  # nobody waits for it: interrupted, or unmounted meanwhile
+            pass
 
 
 def blocks(event):

@@ -185,7 +185,8 @@ class Descriptors(PreferencesTest):
         memory = self.daemon.resident_kib()
         for number in range(300):
             self.assertEqual(caller.set_preference(f"domain{number}", "key", xml("x" * 50_000)), 0)
-        self.assertLessEqual(self.daemon.descriptors() - before, 16)
+        # The last request's own is closed after its answer.
+        eventually(lambda: self.daemon.descriptors() - before <= 16, what="few descriptors")
         if not SANITIZED:
             self.assertLess(self.daemon.resident_kib() - memory, 16 * 1024)
 
