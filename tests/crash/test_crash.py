@@ -270,8 +270,7 @@ class KilledWhileItMakesAChild(unittest.TestCase):
 
         def has_lock():
             self.assertTrue(self.daemon.running())
-            folder = pathlib.Path(f"/proc/{self.daemon.pid}/fd")
-            return any(os.readlink(each).endswith(".lock") for each in folder.iterdir())
+            return any(each.endswith(".lock") for each in harness.open_files(self.daemon.pid))
         harness.eventually(has_lock, what="the lock under which it looks who listens")
         self.killer.end()
         with self.assertRaises(wire.Closed):

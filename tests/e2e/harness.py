@@ -212,11 +212,7 @@ class Daemon:
 
     def sockets(self):
         """How many of its descriptors are sockets: what a connection costs, without what is opened once and kept."""
-        count = 0
-        for descriptor in os.listdir(f"/proc/{self.pid}/fd"):
-            with contextlib.suppress(FileNotFoundError):  # closed since
-                count += os.readlink(f"/proc/{self.pid}/fd/{descriptor}").startswith("socket:")
-        return count
+        return sum(each.startswith("socket:") for each in open_files(self.pid))
 
     def threads(self):
         """Their names. One that ends while they are read, a resolver's for instance, is not among them."""
@@ -305,6 +301,15 @@ def eventually(condition, timeout=10, what="the condition"):
         time.sleep(0.01)
         last, looked = looked, time.monotonic()
         left -= min(looked - last, 0.1)
+
+
+def open_files(pid):
+    """What a process's descriptors are, as the kernel names it, without those that it closes meanwhile."""
+    found = []
+    for descriptor in pathlib.Path(f"/proc/{pid}/fd").iterdir():
+        with contextlib.suppress(FileNotFoundError):
+            found.append(os.readlink(descriptor))
+    return found
 
 
 def stop_process(pid):

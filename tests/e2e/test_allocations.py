@@ -757,11 +757,7 @@ class CheckIn(AllocationsTest):
         return harness.as_account(account or "root", work)
 
     def has_clock(self):
-        for descriptor in pathlib.Path(f"/proc/{self.daemon.pid}/fd").iterdir():
-            with contextlib.suppress(FileNotFoundError):
-                if "timerfd" in os.readlink(descriptor):
-                    return True
-        return False
+        return any("timerfd" in each for each in harness.open_files(self.daemon.pid))
 
     def sweep_check_in(self, account, right, name):
         self.start_closing_thread()

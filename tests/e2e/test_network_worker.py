@@ -1,15 +1,13 @@
 # SPDX-License-Identifier: Apache-2.0
 # SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 """The network worker of the real daemon: what it is, and what its death costs at every step of its work."""
-import gzip
-import contextlib
 import os
 import pathlib
 import random
 import re
 import time
 
-from harness import ERROR, LOG_ERR, SANITIZED, HelperTest, as_account, eventually, kill_process, main, stop_process
+from harness import ERROR, LOG_ERR, SANITIZED, as_account, eventually, kill_process, main, open_files, stop_process
 from intrusion import tell_ways_into
 from test_lasd import ALL, DIRECTORY, HOST, UpdateTest, request_check
 from test_location import Brenvik, LocationTest, civic
@@ -44,16 +42,9 @@ class WorkerTest:
 
 
 class Updates(WorkerTest, UpdateTest):
-    def descriptors(self, process):
-        found = []
-        for number in os.listdir(f"/proc/{process}/fd"):
-            with contextlib.suppress(FileNotFoundError):  # closed since
-                found.append(os.readlink(f"/proc/{process}/fd/{number}"))
-        return found
-
     def strange_descriptors(self, worker):
         usual = r"/dev/null|pipe:|socket:|anon_inode:\[event(poll|fd)\]|anon_inode:\[timerfd\]"
-        return [link for link in self.descriptors(worker) if not re.match(usual, link)]
+        return [link for link in open_files(worker) if not re.match(usual, link)]
 
     def test_it_is_nobody_and_has_nothing_of_the_daemons(self):
         self.serve({"gsm": "1"})
@@ -69,8 +60,8 @@ class Updates(WorkerTest, UpdateTest):
         # Its connection, its logs, and what its own loops need; of the daemon nothing but standard error.
         # What it was given for the check it gives back a moment after its answer.
         eventually(lambda: not self.strange_descriptors(worker), what="nothing of the daemon's")
-        links = self.descriptors(worker)
-        ours = {os.readlink(f"/proc/{self.daemon.pid}/fd/{number}") for number in os.listdir(f"/proc/{self.daemon.pid}/fd")}
+        links = open_files(worker)
+        ours = set(open_files(self.daemon.pid))
         self.assertEqual([link for link in links if link.startswith("socket:") and link in ours], [])
 
     def test_its_own_account_looks_into_it_no_more_than_anybody_else(self):
@@ -83,9 +74,8 @@ class Updates(WorkerTest, UpdateTest):
     def test_the_daemon_has_no_socket_to_the_network(self):
         self.serve({"gsm": "1"})
         self.assertEqual(self.check(), ["UpdateAvailable gsm"])
+        sockets = {match[1] for each in open_files(self.daemon.pid) if (match := re.fullmatch(r"socket:\[(\d+)\]", each))}
         unix = {line.split()[6] for line in pathlib.Path(f"/proc/{self.daemon.pid}/net/unix").read_text().splitlines()[1:]}
-        sockets = {match[1] for number in os.listdir(f"/proc/{self.daemon.pid}/fd")
-                   if (match := re.fullmatch(r"socket:\[(\d+)\]", os.readlink(f"/proc/{self.daemon.pid}/fd/{number}")))}
         self.assertTrue(sockets)
         self.assertEqual(sockets - unix, set())
 

@@ -28,7 +28,7 @@ import time
 import traceback
 
 import wire
-from harness import BUILD, SANITIZED, HelperTest, as_account, entitle, eventually, main
+from harness import BUILD, SANITIZED, HelperTest, as_account, entitle, eventually, main, open_files
 
 SECONDS = float(os.environ.get("BRENVIK_SIEGE_SECONDS", 15))
 SEED = int(os.environ.get("BRENVIK_SIEGE_SEED", random.SystemRandom().randrange(1 << 32)))
@@ -360,10 +360,7 @@ class HeavilyUsed(HelperTest):
 
     def descriptors(self):
         """What the daemon has open. Files of preferences it may keep open, sixteen at most."""
-        links = []
-        for number in os.listdir(f"/proc/{self.daemon.pid}/fd"):
-            with contextlib.suppress(FileNotFoundError):  # closed since it was listed
-                links.append(re.sub(r":.*", "", os.readlink(f"/proc/{self.daemon.pid}/fd/{number}")))
+        links = [re.sub(r":.*", "", each) for each in open_files(self.daemon.pid)]
         preferences = [link for link in links if "/Library/Preferences/" in link]
         self.assertLessEqual(len(preferences), 16)
         return sorted(link for link in links if link not in preferences)

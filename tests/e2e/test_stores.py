@@ -16,7 +16,7 @@ import threading
 import time
 
 import wire
-from harness import BUILD, ERROR, HelperTest, as_account, eventually, kill_process, listen, main, stop_process
+from harness import BUILD, ERROR, HelperTest, as_account, eventually, kill_process, listen, main, open_files, stop_process
 from intrusion import tell_ways_into, ways_into
 
 HOME = pathlib.Path("/var/mobile")
@@ -332,8 +332,7 @@ class Worker(StoresTest):
         self.assertEqual(pathlib.Path(f"/proc/{worker}/environ").read_bytes(), b"")
         # Its own account's processes cannot look into it, nor at what it was handed.
         self.assertEqual(as_account("mobile", lambda: int(os.access(f"/proc/{worker}/mem", os.R_OK))), 0)
-        targets = {os.readlink(f"/proc/{worker}/fd/{fd}") for fd in os.listdir(f"/proc/{worker}/fd")}
-        for target in targets:
+        for target in open_files(worker):
             self.assertRegex(target, r"\A(/dev/null|pipe:.*|socket:.*|/var/mobile/Library/Voicemail(/voicemail\.db)?)\Z")
 
     def test_the_helper_knows_no_database(self):
