@@ -138,11 +138,12 @@ int FileContents::copySparse(int source, const struct stat& info, int destinatio
     if (data < 0 && errno == ENXIO) break;  // a hole to the end
     if (data < 0) return errno == EINVAL ? copyRange(source, destination, &at, info.st_size) : errno;
     const off_t hole = ::lseek(source, data, SEEK_HOLE);
-    if (hole < 0) return errno;
+    // It has become shorter since, and the copy is as short: no zeros take the place of what is not there.
+    if (hole < 0) return errno == ENXIO ? 0 : errno;
     const off_t end = std::min(hole, info.st_size);
     at = data;
     if (const int error = copyRange(source, destination, &at, end); error != 0) return error;
-    if (at < end) return 0;  // shorter than it said: no zeros take the place of what is not there
+    if (at < end) return 0;  // the same
   }
   return ::ftruncate(destination, info.st_size) == 0 ? 0 : errno;
 }
