@@ -143,7 +143,7 @@ int FileContents::copySparse(int source, const struct stat& info, int destinatio
     const off_t end = std::min(hole, info.st_size);
     at = data;
     if (const int error = copyRange(source, destination, &at, end); error != 0) return error;
-    if (at < end) return 0;  // the same
+    if (at < end) return 0;  // shorter than it said, too
   }
   return ::ftruncate(destination, info.st_size) == 0 ? 0 : errno;
 }
