@@ -200,6 +200,20 @@ class Mistakes(unittest.TestCase):
         self.assertEqual(done.returncode, 2)
         self.assertIn("does not pass without a mistake", done.stderr)
 
+    @unittest.skipUnless(shutil.which("bwrap") and shutil.which("ninja"), "builds, and runs in a sandbox")
+    def test_a_header_is_tested_by_the_folder_below_it(self):
+        self.write("platform/b/Role.h", "struct Role {\n  int limit = 3;\n};\n")
+        self.write("platform/b/CMakeLists.txt", "add_subdirectory(linux)\n")
+        self.write("platform/b/linux/CMakeLists.txt", "brenvik_tests(platform_b_linux)\n")
+        self.write("platform/b/linux/A.cpp", "#include \"../Role.h\"\nbool isWithin(int a) {\n  return a < Role().limit;\n}\n")
+        self.write("platform/b/linux/ATest.cpp", "bool isWithin(int a);\nint main() { return isWithin(2) && !isWithin(3) ? 0 : 1; }\n")
+        self.write("CMakeLists.txt", BUILD.replace("platform/a", "platform/b"))
+        done = self.mutate("platform/b/Role.h")
+        if "does not pass without a mistake" in done.stderr and os.geteuid() != 0:
+            self.skipTest("no sandbox for this account")
+        self.assertEqual(done.returncode, 0, done.stdout + done.stderr)
+        self.assertRegex(done.stdout, r"platform/b +2 +0 +0 +0 +\d+ +100\.0 %\n")
+
 
 if __name__ == "__main__":
     unittest.main()
