@@ -46,23 +46,32 @@ set(BRENVIK_VISUAL_VOICEMAIL_LIBRARY "libbrenvik-visualvoicemail.so.0" CACHE STR
 set(BRENVIK_VISUAL_VOICEMAIL_SYMBOL "_VisualVoicemailIsSubscribed" CACHE STRING "Subscription query: symbol")
 set(BRENVIK_BASEBAND_LIBRARY "libbrenvik-baseband-helper.so.0" CACHE STRING "Optional hosted baseband server")
 
-# A target that is ours links brenvik_flags. What not every compiler knows is asked for first.
+# A target that is ours links brenvik_flags. What a compiler or linker does not know is left out.
 include(CheckCXXCompilerFlag)
+include(CheckCXXSourceCompiles)
 include(CheckLinkerFlag)
+function(brenvik_keep_known kept)
+  foreach(flag IN LISTS ARGN)
+    string(MAKE_C_IDENTIFIER "BRENVIK_HAS${flag}" known)
+    if(flag MATCHES "^-Wl,")
+      check_linker_flag(CXX ${flag} ${known})
+    else()
+      check_cxx_compiler_flag(${flag} ${known})
+    endif()
+    if(NOT ${known})
+      list(REMOVE_ITEM ARGN ${flag})
+    endif()
+  endforeach()
+  set(${kept} ${ARGN} PARENT_SCOPE)
+endfunction()
 add_library(brenvik_flags INTERFACE)
 add_library(brenvik_c_flags INTERFACE)
 target_compile_definitions(brenvik_flags INTERFACE _GNU_SOURCE)
-target_compile_options(brenvik_flags INTERFACE
-  -Wall -Wextra -Wpedantic -Wshadow -Wnon-virtual-dtor -Wold-style-cast -Wcast-align -Wunused
-  -Woverloaded-virtual -Wconversion -Wsign-conversion -Wdouble-promotion -Wformat=2 -Wimplicit-fallthrough)
+brenvik_keep_known(flags -Wall -Wextra -Wpedantic -Wshadow -Wnon-virtual-dtor -Wold-style-cast -Wcast-align -Wunused
+  -Woverloaded-virtual -Wconversion -Wsign-conversion -Wdouble-promotion -Wformat=2 -Wimplicit-fallthrough
+  -fstack-protector-strong -fno-plt)
+target_compile_options(brenvik_flags INTERFACE ${flags})
 target_compile_options(brenvik_c_flags INTERFACE -Wall -Wextra -Wpedantic -Wshadow -Wconversion)
-foreach(flag -fstack-protector-strong -fno-plt)
-  string(MAKE_C_IDENTIFIER "BRENVIK_HAS${flag}" known)
-  check_cxx_compiler_flag(${flag} ${known})
-  if(${known})
-    target_compile_options(brenvik_flags INTERFACE ${flag})
-  endif()
-endforeach()
 # g++ 12 sees overlaps in std::string concatenation that are not there (GCC bug 105651), when it optimises. The
 # positive form is asked for, because g++ takes any -Wno- without a word.
 check_cxx_compiler_flag(-Wrestrict BRENVIK_HAS_Wrestrict)
@@ -105,23 +114,30 @@ if(BRENVIK_FUZZ)
   endif()
   add_compile_options(-fsanitize=fuzzer-no-link)
 endif()
-if(NOT BRENVIK_SANITIZE AND NOT BRENVIK_FUZZ AND CMAKE_BUILD_TYPE STREQUAL "Release")
-  add_compile_definitions(_FORTIFY_SOURCE=2)
-  add_link_options(-Wl,-z,relro,-z,now -Wl,--as-needed -Wl,--gc-sections)
-  # Packed relocations: fewer pages to read at each start.
-  check_linker_flag(CXX -Wl,-z,pack-relative-relocs BRENVIK_HAS_PACKED_RELOCATIONS)
-  if(BRENVIK_HAS_PACKED_RELOCATIONS)
-    add_link_options(-Wl,-z,pack-relative-relocs)
+if(NOT BRENVIK_SANITIZE AND NOT BRENVIK_FUZZ AND NOT CMAKE_BUILD_TYPE MATCHES "^(Debug)?$")
+  # A packager's flags may ask for more than this, and "None", which some use, optimises only when they say so.
+  check_cxx_source_compiles("
+    #ifdef _FORTIFY_SOURCE
+    #error named already
+    #endif
+    int main() {}" BRENVIK_MAY_FORTIFY)
+  if(BRENVIK_MAY_FORTIFY AND CMAKE_BUILD_TYPE MATCHES "Rel")
+    add_compile_definitions(_FORTIFY_SOURCE=2)
   endif()
-  add_compile_options(-ffunction-sections -fdata-sections)
+  # Packed relocations: fewer pages to read at each start.
+  brenvik_keep_known(flags -Wl,-z,relro -Wl,-z,now -Wl,--as-needed -Wl,--gc-sections -Wl,-z,pack-relative-relocs)
+  add_link_options(${flags})
   # Nothing here asks an object for its type, and the answers would be two of the six pages that each start relocates.
   # The sanitizers need them, so not in the other builds.
-  add_compile_options($<$<COMPILE_LANGUAGE:CXX>:-fno-rtti>)
+  brenvik_keep_known(flags -fno-rtti)
+  add_compile_options("$<$<COMPILE_LANGUAGE:CXX>:${flags}>")
   # Log entries name their source file. It is named from the root of the sources, wherever that is, and whether a
   # compiler cache has made the path relative to the build folder or not: what is installed is the same.
   file(RELATIVE_PATH to_sources ${PROJECT_BINARY_DIR} ${PROJECT_SOURCE_DIR})
   string(REGEX REPLACE "([^/])$" "\\1/" to_sources "${to_sources}")
-  add_compile_options(-fmacro-prefix-map=${PROJECT_SOURCE_DIR}/= -fmacro-prefix-map=${to_sources}=)
+  brenvik_keep_known(flags -ffunction-sections -fdata-sections -fmacro-prefix-map=${PROJECT_SOURCE_DIR}/=
+                     -fmacro-prefix-map=${to_sources}=)
+  add_compile_options(${flags})
 endif()
 
 # ccache, where there is one, makes the sanitizer builds of a second run cheap.
