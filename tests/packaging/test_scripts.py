@@ -132,5 +132,35 @@ class Setup(Scripts):
                                               "docs/dependencies.md lists the packages and what each is for"])
 
 
+class InDebian(Scripts):
+    """The minimal system is there already, or cannot be made."""
+
+    def setUp(self):
+        super().setUp()
+        self.copy("scripts/in-debian")
+        self.copy("scripts/list-files")
+        self.environment |= {"BRENVIK_CACHE": str(self.tree / "cache"), "BRENVIK_DEBIAN_MIRROR": "http://mirror.example/debian"}
+
+    @AS_ROOT
+    def test_the_mirror_that_the_environment_names(self):
+        self.program("bin/debootstrap", 'echo "$*"; exit 1')
+        done = self.run_script("scripts/in-debian", "bookworm", "true")
+        self.assertEqual((done.returncode, done.stderr.splitlines()[1:]), (1, [
+            f"--variant=minbase --include=ca-certificates bookworm {self.tree}/cache/debian-bookworm http://mirror.example/debian",
+            "in-debian: no bookworm could be made; is a Debian mirror within reach?"]))
+
+    @unittest.skipUnless(subprocess.run(["unshare", "--mount", "--pid", "--fork", "true"], check=False, capture_output=True).returncode == 0,
+                         "no namespaces")
+    @AS_ROOT
+    def test_an_overlay_that_is_refused(self):
+        self.write("cache/debian-bookworm/etc/brenvik-complete", "")
+        self.program("bin/debootstrap")
+        self.program("bin/mount", 'echo "mount: $*: not permitted" >&2; exit 32')
+        done = self.run_script("scripts/in-debian", "bookworm", "true")
+        self.assertEqual(done.returncode, 1)
+        self.assertIn(f"\nin-debian: no overlay mount is possible in {self.tree}/cache: ", done.stderr)
+        self.assertEqual([path.name for path in (self.tree / "cache").glob("layer-*")], [])
+
+
 if __name__ == "__main__":
     unittest.main()
