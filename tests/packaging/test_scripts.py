@@ -162,5 +162,30 @@ class InDebian(Scripts):
         self.assertEqual([path.name for path in (self.tree / "cache").glob("layer-*")], [])
 
 
+class Test(Scripts):
+    """Every step passes at once, but the install test."""
+
+    def setUp(self):
+        super().setUp()
+        self.copy("scripts/test")
+        for name in ("scripts/setup", "scripts/check-source", "scripts/check-code", "scripts/siege", "scripts/fuzz", "bin/cmake", "bin/ctest"):
+            self.program(name)
+
+    def ends(self, install, *arguments):
+        """Exit status, and what is said under "done"."""
+        self.program("tests/install/run", f'[ "${{1:-}}" = --prepare ] || {{ {install}; }}')
+        done = self.run_script("scripts/test", *arguments)
+        self.assertEqual(done.stderr, "")
+        return done.returncode, done.stdout.partition("==== done (0m")[2].splitlines()[1:]
+
+    def test_what_was_left_out_is_named_at_the_end(self):
+        skipped = "echo 'install test: SKIPPED: systemd-nspawn is not installed'; exit 77"
+        told = ["test: NOT RUN: the install test, because: systemd-nspawn is not installed"]
+        self.assertEqual(self.ends(skipped), (0, told))
+        self.assertEqual(self.ends(skipped, "--require-all"), (77, told))
+        self.assertEqual(self.ends("exit 0", "--require-all"), (0, []))
+        self.assertEqual(self.ends("exit 3", "--require-all"), (3, []))
+
+
 if __name__ == "__main__":
     unittest.main()
