@@ -23,6 +23,16 @@ mark_as_advanced(BRENVIK_BUILD_TOOLS_ONLY)
 if(CMAKE_CXX_BYTE_ORDER STREQUAL "BIG_ENDIAN")
   message(FATAL_ERROR "BrenvikMobileHelper runs on little-endian machines only; ${CMAKE_SYSTEM_PROCESSOR} is not one.")
 endif()
+# The filters of system calls are written for these two processors: on another one every caller would be refused.
+if(NOT BRENVIK_CLIENT_ONLY AND NOT BRENVIK_BUILD_TOOLS_ONLY)
+  string(TOLOWER "${CMAKE_SYSTEM_PROCESSOR}" processor)
+  if(NOT processor MATCHES "^(x86_64|amd64|aarch64|arm64)$" OR NOT CMAKE_SIZEOF_VOID_P EQUAL 8)
+    math(EXPR bits "${CMAKE_SIZEOF_VOID_P} * 8")
+    message(FATAL_ERROR "BrenvikMobileHelper runs on 64-bit x86-64 and aarch64 only; this build is for \"${CMAKE_SYSTEM_PROCESSOR}\" "
+      "(CMAKE_SYSTEM_PROCESSOR) with ${bits} bits. The client library alone, -DBRENVIK_CLIENT_ONLY=ON, can be built for any "
+      "little-endian machine.")
+  endif()
+endif()
 
 set(BRENVIK_BOOTSTRAP_DIRECTORY "/run/brenvik/bootstrap" CACHE STRING "Socket files of named services")
 set(BRENVIK_SERVICE_GROUP "brenvik" CACHE STRING "Group that may connect to the service socket")
