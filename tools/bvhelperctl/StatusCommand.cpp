@@ -286,13 +286,12 @@ Outcome running(const StatusReport& report) {
                                  ? "version " + printable(report.version) + " runs, version " +
                                        printable(*installed) + " is installed"
                                  : "the program that runs is not the one that is installed";
-    const std::string stop = std::string("systemctl stop ") + kServiceUnit;
+    const std::string early =
+        report.busyTokens == 0 ? ""
+                               : ", for which it is too early: " + counted(report.busyTokens, "busy token");
     outcome.notes.push_back("restart pending: " + what +
-                            (report.busyTokens == 0
-                                 ? "; the helper leaves by itself when it is idle, or by " + stop
-                                 : "; the helper has " + counted(report.busyTokens, "busy token") +
-                                       ": do not " + stop +
-                                       " before it has none; it leaves by itself when it is idle"));
+                            "; the helper leaves by itself when it is idle, or by systemctl stop " +
+                            kServiceUnit + early);
   }
   return outcome;
 }

@@ -600,9 +600,10 @@ class Status(ToolTest):
         notes = [self.run_tool("status")[1] for _ in range(3)]
         for note in notes:
             self.assertIn("restart pending", note)
-        self.assertIn("when it is idle, or by systemctl stop brenvik-mobile-helper.service", notes[0])
+            self.assertIn("when it is idle, or by systemctl stop brenvik-mobile-helper.service", note)
+        self.assertNotIn("too early", notes[0])
         for note, count in zip(notes[1:], ("1 busy token", "2 busy tokens")):
-            self.assertIn(f"{count}: do not systemctl stop brenvik-mobile-helper.service before it has none", note)
+            self.assertTrue(note.endswith(f"brenvik-mobile-helper.service, for which it is too early: {count}\n"), note)
 
     def test_an_idle_helper_says_when_it_leaves(self):
         self.answer(self.text("leaves-in-ms=6001"), self.text("leaves-in-ms=6001", "kept-by-baseband=yes"))
