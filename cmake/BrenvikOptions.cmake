@@ -23,6 +23,18 @@ mark_as_advanced(BRENVIK_BUILD_TOOLS_ONLY)
 if(CMAKE_CXX_BYTE_ORDER STREQUAL "BIG_ENDIAN")
   message(FATAL_ERROR "BrenvikMobileHelper runs on little-endian machines only; ${CMAKE_SYSTEM_PROCESSOR} is not one.")
 endif()
+# The programs that a cross build runs are for the machine that builds, whatever that is.
+if(NOT BRENVIK_BUILD_TOOLS_ONLY)
+  if(NOT CMAKE_SIZEOF_VOID_P EQUAL 8)
+    message(FATAL_ERROR "BrenvikMobileHelper runs on 64-bit machines only; this build's pointers have ${CMAKE_SIZEOF_VOID_P} bytes.")
+  endif()
+  # The filters of system calls are written for these two: on another one every caller would be refused.
+  string(TOLOWER "${CMAKE_SYSTEM_PROCESSOR}" processor)
+  if(NOT BRENVIK_CLIENT_ONLY AND NOT processor MATCHES "^(x86_64|amd64|aarch64|arm64)$")
+    message(FATAL_ERROR "BrenvikMobileHelper runs on x86-64 and aarch64 only; CMAKE_SYSTEM_PROCESSOR is \"${CMAKE_SYSTEM_PROCESSOR}\". "
+      "The client library alone, -DBRENVIK_CLIENT_ONLY=ON, can be built for any 64-bit little-endian machine.")
+  endif()
+endif()
 
 set(BRENVIK_BOOTSTRAP_DIRECTORY "/run/brenvik/bootstrap" CACHE STRING "Socket files of named services")
 set(BRENVIK_SERVICE_GROUP "brenvik" CACHE STRING "Group that may connect to the service socket")

@@ -360,6 +360,22 @@ class Command(StatusTest):
         self.assertIs(told["restartPending"], True)
         self.assertIn("the program that runs is not the one that is installed", told["notes"][0])
 
+    def test_a_replaced_helper_without_a_status_socket_has_a_restart_pending(self):
+        """As after an upgrade from a version that had none."""
+        self.daemon.stop()
+        program = self.folder / "BrenvikMobileHelper"
+        shutil.copy(DAEMON, program)
+        self.start_copy(program)
+        STATUS.unlink()
+        self.assertNotIn("restart pending", self.status(status=1)["error"])
+        new = self.folder / "new"
+        shutil.copy(DAEMON, new)
+        new.rename(program)
+        answer = self.status(status=1)
+        self.assertIn("tells nothing", answer["error"])
+        self.assertIn("restart pending: its program is not the one that is installed", answer["error"])
+        self.assertIn("systemctl stop brenvik-mobile-helper.service", answer["advice"])
+
     def start_copy(self, program):
         helper = subprocess.Popen([program], stdin=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
         self.addCleanup(helper.wait)

@@ -120,28 +120,32 @@ class Library:
         for name in ("BVMobileHelperCopyVoicemailToken", "BVMobileHelperCopyCountryCode"):
             getattr(self.lib, name).argtypes = [ctypes.c_void_p, ctypes.c_char_p, ctypes.c_size_t]
 
+    def ask(self, client, routine="BVMobileHelperCopyVoicemailToken"):
+        """Returns the code and the text that is answered."""
+        buffer = ctypes.create_string_buffer(257)
+        code = getattr(self.lib, routine)(client, buffer, 257)
+        return code, buffer.value.decode()
+
     def request(self, path, routine="BVMobileHelperCopyVoicemailToken"):
         """One client, one check-in, one request. Returns the code and the text that is answered."""
         client = self.lib.bvmh_client_create()
         try:
             code = self.lib.bvmh_client_set_socket(client, path.encode())
-            buffer = ctypes.create_string_buffer(257)
             if code == 0:
                 code = self.lib.bvmh_connect(client)
-            if code == 0:
-                code = getattr(self.lib, routine)(client, buffer, 257)
-            return code, buffer.value.decode()
+            return self.ask(client, routine) if code == 0 else (code, "")
         finally:
             self.lib.bvmh_client_free(client)
 
     @contextlib.contextmanager
     def connected(self, path):
-        """A client that asks for nothing: as long as it is there, the helper does not leave."""
+        """A client that asks for nothing, but when the function is called that it is given: as long as it is there, the helper
+        does not leave."""
         client = self.lib.bvmh_client_create()
         try:
             expect_equal(self.lib.bvmh_client_set_socket(client, path.encode()), 0, "its socket")
             expect_equal(self.lib.bvmh_connect(client), 0, "its check-in")
-            yield
+            yield lambda: self.ask(client)
         finally:
             self.lib.bvmh_client_free(client)
 
@@ -304,8 +308,7 @@ def workers_listen():
 
 def install():
     BEFORE.update(everything())
-    packages = glob.glob("/packages/*_*.deb")
-    run("dpkg", "-i", *packages, env={**os.environ, "DEBIAN_FRONTEND": "noninteractive"})
+    install_all("/packages")
     expect_equal(property_of(SOCKET, "ActiveState"), "active", SOCKET)
     expect_equal(property_of(SOCKET, "UnitFileState"), "enabled", SOCKET)
     expect_equal(property_of(SERVICE, "ActiveState"), "inactive", "nobody has asked yet")
@@ -972,13 +975,21 @@ def comes_back_after_a_limit():
     hit_a_limit("trigger-limit-hit", service="[Unit]\nStartLimitBurst=1000\n", socket="[Socket]\nTriggerLimitIntervalSec=60s\nTriggerLimitBurst=5\n")
 
 
+def install_all(folder):
+    """All packages of the folder at once, the places first, and as apt does it. Returns what the package manager printed."""
+    return run("dpkg", "--auto-deconfigure", "-i", *sorted(glob.glob(f"{folder}/*_*.deb")),
+               env={**os.environ, "DEBIAN_FRONTEND": "noninteractive"}).stdout
+
+
 def version_of(package):
     return run("dpkg-deb", "-f", package, "Version").stdout.strip()
 
 
 def install_the_next_version():
-    """Returns what the package manager printed."""
-    return run("dpkg", "-i", *glob.glob("/packages/upgrade/*.deb"), env={**os.environ, "DEBIAN_FRONTEND": "noninteractive"}).stdout
+    """Returns what the package manager printed. The daemon's package stays configured all the time."""
+    printed = install_all("/packages/upgrade")
+    expect("De-configuring" not in printed, printed)
+    return printed
 
 
 class AsksOn:
@@ -1115,6 +1126,53 @@ def upgrade_from_a_version_without_workers():
     expect_equal(pathlib.Path("/proc/sys/net/ipv4/ping_group_range").read_text().split(), ["0", "2147483647"], "ping sockets")
 
 
+def owner_of(path):
+    return run("dpkg", "-S", path).stdout.split(":")[0]
+
+
+def install_the_earlier_release():
+    BEFORE.update(everything())
+    install_all("/packages/earlier")
+    expect_equal(property_of(SOCKET, "ActiveState"), "active", SOCKET)
+    run("cp", "/usr/share/doc/bvhelperctl/examples/50-bvhelperctl.plist", "/etc/brenvik/entitlements.d/")
+    entitle_this_test()
+    bvhelperctl("prefs", "set", "com.example.install", "text", "Grüße")
+    bvhelperctl("voicemail", "set-token", "a-token")
+
+
+def upgrade_from_the_earlier_release():
+    """All packages at once, with a client that stays connected: the helper of the earlier release serves it on until it is
+    ended as the manual page says, and the client goes on with the new one."""
+    gazetteer = "/usr/share/brenvik/gazetteer.db"
+    print(f"        {gazetteer} was in {owner_of(gazetteer)}", flush=True)
+    with Library().connected(PATH) as ask:
+        process = property_of(SERVICE, "MainPID")
+        printed = install_all("/packages")
+        for text in (f"process {process}", "replaced", "bvhelperctl status", f"systemctl stop {SERVICE}"):
+            expect(text in printed, f"the package manager does not print: {text}\n{printed}")
+        expect_equal(run("dpkg", "-V", *PACKAGES, check=False).stdout, "", "dpkg --verify")
+        expect_equal(owner_of(gazetteer), "brenvik-mobile-helper-data", gazetteer)
+        workers_listen()
+
+        expect_equal(property_of(SERVICE, "MainPID"), process, "a helper at work is left alone")
+        expect(os.readlink(f"/proc/{process}/exe").endswith(" (deleted)"), "it is the earlier program")
+        expect_equal(ask(), (0, "a-token"), "it serves its client on")
+        expect_equal(bvhelperctl("prefs", "get", "com.example.install", "text").stdout, "Grüße\n", "and the new bvhelperctl")
+        told = bvhelperctl("status", check=False)
+        expect(f"process {process}" in told.stdout + told.stderr and "restart pending" in told.stderr,
+               f"what status says of it: {told.stdout}{told.stderr}")
+
+        # As BrenvikMobileHelper(8) has it, "UPGRADING".
+        run("sh", "-c", "while bvhelperctl --json status | grep -q '\"busyTokens\":[1-9]'; do sleep 1; done\n"
+                        f"systemctl stop {SERVICE}")
+        expect_equal(ask(), (0, "a-token"), "the client has not noticed")
+        started = property_of(SERVICE, "MainPID")
+        expect(started != process and os.path.samefile(f"/proc/{started}/exe", HELPER), "the program that is installed runs")
+        expect_equal(bvhelperctl("prefs", "get", "com.example.install", "text").stdout, "Grüße\n", "what was stored stays")
+        status = json.loads(bvhelperctl("--json", "status").stdout)
+        expect_equal((status["pid"], status["restartPending"], "notes" in status), (int(started), False, False), "status")
+
+
 def remove():
     run("dpkg", "-r", "brenvik-mobile-helper")
     for path in (PATH, *WORKERS.values()):
@@ -1157,6 +1215,8 @@ def main():
              a_burst_is_one_start, nothing_is_lost_at_the_idle_edge, comes_back_after_a_limit,
              upgrade_under_a_living_telephony_daemon,
              upgrade_from_a_version_without_workers, remove, purge]
+    if sys.argv[1:] == ["earlier"]:
+        steps = [install_the_earlier_release, upgrade_from_the_earlier_release, remove, purge]
     for step in steps:
         began = time.monotonic()
         try:

@@ -16,6 +16,8 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <filesystem>
+#include <system_error>
 #include <thread>
 #include <utility>
 
@@ -284,19 +286,38 @@ Outcome running(const StatusReport& report) {
                                  ? "version " + printable(report.version) + " runs, version " +
                                        printable(*installed) + " is installed"
                                  : "the program that runs is not the one that is installed";
+    const std::string early =
+        report.busyTokens == 0 ? ""
+                               : ", for which it is too early: " + counted(report.busyTokens, "busy token");
     outcome.notes.push_back("restart pending: " + what +
-                            "; the helper leaves by itself when it is idle, or by systemctl "
-                            "stop " +
-                            kServiceUnit);
+                            "; the helper leaves by itself when it is idle, or by systemctl stop " +
+                            kServiceUnit + early);
   }
   return outcome;
 }
 
+// Whether the program that the process was started from has been replaced since. /proc shows that to root
+// alone.
+bool isReplaced(const HelperProcess& process) {
+  std::error_code error;
+  const auto program =
+      std::filesystem::read_symlink("/proc/" + std::to_string(process.id) + "/exe", error).string();
+  // As the kernel marks a file that has been removed, or replaced by another.
+  return !error && program.ends_with(" (deleted)");
+}
+
 Outcome runsUnseen(const HelperProcess& process, const std::string& path) {
+  const std::string tells = "the helper runs (process " + std::to_string(process.id) +
+                            "), and tells nothing: there is no " + printable(path);
+  if (isReplaced(process)) {
+    return failedWith(
+        ExitStatus::failed, tells + "; restart pending: its program is not the one that is installed",
+        std::string("It is of an older version, which has no status. It leaves by itself when it is "
+                    "idle, or by systemctl stop ") +
+            kServiceUnit + "; a call that it carries out then gets no answer.");
+  }
   return failedWith(
-      ExitStatus::failed,
-      "the helper runs (process " + std::to_string(process.id) + "), and tells nothing: there is no " +
-          printable(path),
+      ExitStatus::failed, tells,
       std::string("It is starting or leaving, is of an older version, or may not write that folder; "
                   "journalctl -u ") +
           kServiceUnit + " tells.");

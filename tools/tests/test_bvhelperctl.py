@@ -594,6 +594,17 @@ class Status(ToolTest):
         self.assertEqual(answer["workers"], [{"name": "callers", "running": True}, {"name": "network", "running": True},
                                              {"name": "stores", "running": False}])
 
+    def test_a_pending_restart_waits_for_busy_tokens(self):
+        replaced = self.text("replaced=yes")
+        self.answer(replaced, *(self.text("replaced=yes", **{"busy-tokens": count}) for count in (1, 2)))
+        notes = [self.run_tool("status")[1] for _ in range(3)]
+        for note in notes:
+            self.assertIn("restart pending", note)
+            self.assertIn("when it is idle, or by systemctl stop brenvik-mobile-helper.service", note)
+        self.assertNotIn("too early", notes[0])
+        for note, count in zip(notes[1:], ("1 busy token", "2 busy tokens")):
+            self.assertTrue(note.endswith(f"brenvik-mobile-helper.service, for which it is too early: {count}\n"), note)
+
     def test_an_idle_helper_says_when_it_leaves(self):
         self.answer(self.text("leaves-in-ms=6001"), self.text("leaves-in-ms=6001", "kept-by-baseband=yes"))
         self.assertIn("held by       nothing: idle, leaves in 7 s\n", self.run_tool("status")[0])
