@@ -113,10 +113,10 @@ function(brenvik_tests target)
                                                   ${ARG_DEPENDS} GTest::gmock_main Threads::Threads)
   target_precompile_headers(${target}_tests REUSE_FROM brenvik_test_precompiled)
   add_test(NAME ${target} COMMAND ${target}_tests)
-  # Ends one that hangs; a slow machine with a slow disk and a sanitizer may take minutes, an emulator ten times as long.
+  # Ends one that hangs; a slow machine with a slow disk and a sanitizer may take minutes, an emulator twice as long.
   set(timeout 600)
   if(CMAKE_CROSSCOMPILING)
-    set(timeout 3600)
+    set(timeout 1200)
   endif()
   set_tests_properties(${target} PROPERTIES LABELS "unit;${ARG_LABELS}" TIMEOUT ${timeout})
 endfunction()

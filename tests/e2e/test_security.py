@@ -225,7 +225,8 @@ class Attacks(Besieged):
         plain = pathlib.Path("/tmp/plain")
         shutil.copy2(self.PYTHON, plain)
         self.addCleanup(plain.unlink)
-        reply = "import socket,struct; s = socket.socket(fileno=9); raise SystemExit(struct.unpack_from('<i', s.recv(99), 32)[0])"
+        reply = ("import socket,struct; s = socket.socket(fileno=9); s.settimeout(20); "
+                 "raise SystemExit(struct.unpack_from('<i', s.recv(99), 32)[0])")
         code = (self.IMPORTS + "import os, socket\n"
                 "service = wire.connect()\n"
                 "_, theirs = socket.socketpair(socket.AF_UNIX, socket.SOCK_SEQPACKET)\n"
@@ -245,6 +246,7 @@ class Attacks(Besieged):
             self.daemon.process.send_signal(signal.SIGCONT)
         with attack:
             self.assertEqual(attack.wait(20), 35)
+        eventually(lambda: any(each[0] > stopped for each in list(self.slowest)), what="a call after the stop")
         self.slowest[:] = [each for each in self.slowest if each[0] > stopped]
 
 

@@ -199,6 +199,8 @@ class InstalledClient(unittest.TestCase):
 
     def test_the_shared_library_needs_the_c_and_cpp_libraries_only(self):
         needed = set(re.findall(r"NEEDED +(\S+)", run("objdump", "-p", self.library)))
+        # The loader, which belongs to the C library, is named where the value that guards the stack is its own: on arm64.
+        needed = {name for name in needed if not name.startswith("ld-linux-")}
         self.assertLessEqual(needed, {"libc.so.6", "libm.so.6", "libstdc++.so.6", "libgcc_s.so.1"})
 
     def test_the_library_alone_builds_without_any_other_package(self):
