@@ -151,6 +151,24 @@ std::string shortText(Random& random) {
   return random.of(std::array<std::string, 4>{"", "a", "token", "\xE2\x82\xAC"});
 }
 
+// The one that fails, counted from 0: few requests make more than that.
+long allocationOf(Random& random) { return static_cast<long>(random.below(random.oneIn(2) ? 12 : 80)); }
+
+WorkerEnd workerEndOf(Random& random) {
+  return random.oneIn(2) ? WorkerEnd::beforeTheWork : WorkerEnd::afterTheWork;
+}
+
+CheckInWhims checkInWhims(Random& random) {
+  CheckInWhims whims;
+  whims.diesAtOnce = random.oneIn(12);
+  if (random.oneIn(8)) {
+    whims.failsAt = allocationOf(random);
+  } else if (random.oneIn(10)) {
+    whims.callerWorker = workerEndOf(random);
+  }
+  return whims;
+}
+
 Call callOf(Random& random) {
   Call call;
   call.row = random.below(kRequestRoutines.size());
@@ -236,11 +254,14 @@ Call callOf(Random& random) {
       call.form = random.oneIn(2) ? Call::Form::wrongLength : Call::Form::wrongType;
     }
   }
-  // Rows whose fakes can do with a lack of memory, and which leave nothing running.
-  constexpr std::array memoryRows{4, 6, 7, 8, 9, 10, 11, 15, 16, 17, 19, 23};
-  if (call.form == Call::Form::right && random.oneIn(12) &&
-      std::find(memoryRows.begin(), memoryRows.end(), static_cast<int>(call.row)) != memoryRows.end()) {
-    call.failsAt = static_cast<long>(random.below(random.oneIn(2) ? 12 : 80));
+  constexpr std::array workerRows{0, 1, 2, 3, 4, 5, 22, 26};
+  const bool hasWorker =
+      std::find(workerRows.begin(), workerRows.end(), static_cast<int>(call.row)) != workerRows.end();
+  if (call.form != Call::Form::right) return call;
+  if (random.oneIn(10)) {
+    call.failsAt = allocationOf(random);
+  } else if (hasWorker && random.oneIn(8)) {
+    call.workerEnd = workerEndOf(random);
   }
   return call;
 }
@@ -294,7 +315,8 @@ WebAnswer webAnswer(Machine& machine, const std::string& url) {
     machine.rules.manifests[manifest.body] = manifest;
     answer.body = manifest.body;
   } else {
-    answer.body = (random.oneIn(8) ? "gz!" : "gz:") + url + " " + std::to_string(random.below(100));
+    answer.body = (random.oneIn(6) ? random.of(std::array{"gz!", "gz?", "gz."}) : "gz:") + url + " " +
+                  std::to_string(random.below(100));
     if (!random.oneIn(12)) answer.contentType = random.oneIn(9) ? "text/GZIP" : "application/x-gzip";
   }
   if (random.oneIn(15)) answer.body.clear();
@@ -335,7 +357,7 @@ Machine::GeoAnswer geoAnswer(Machine& machine) {
 
 void changeSurroundings(Machine& machine, Random& random) {
   Surroundings& around = machine.around;
-  switch (random.below(13)) {
+  switch (random.below(14)) {
     case 0:
       around.countryCode = random.oneIn(3)   ? std::nullopt
                            : random.oneIn(4) ? std::optional(std::string(70, 'c'))
@@ -382,6 +404,9 @@ void changeSurroundings(Machine& machine, Random& random) {
       around.archiveFatal =
           around.archiveResult != 0 && random.oneIn(2) ? std::optional(EINVAL) : std::nullopt;
       break;
+    case 12:
+      machine.networkWorkerDies();
+      break;
     default:
       machine.web.route = random.of(std::array{Route::wifi, Route::wifi, Route::cellular, Route::none});
   }
@@ -407,11 +432,11 @@ void take(Machine& machine, const Step& step) {
     if (connection.isOpen && connection.port != kNullPort) open.push_back(id);
   }
   if (what < 8 || !hasProcess) {
-    machine.checkIn(machine.spawn(random.oneIn(3) ? 501 : 0, holdsOf(random)), CheckInForm::right,
-                    random.oneIn(15));
+    const uid_t uid = random.oneIn(3) ? 501 : 0;
+    machine.checkIn(machine.spawn(uid, holdsOf(random)), CheckInForm::right, checkInWhims(random));
   } else if (what < 16) {
     const auto form = random.oneIn(8) ? static_cast<CheckInForm>(random.below(8)) : CheckInForm::right;
-    machine.checkIn(process, form, random.oneIn(12));
+    machine.checkIn(process, form, checkInWhims(random));
   } else if (what < 78) {
     for (std::size_t i = random.oneIn(8) ? random.below(20) : 1; i > 0 && !open.empty(); --i) {
       machine.call(random.of(open), callOf(random));

@@ -97,6 +97,67 @@ std::string described(const Line& line) {
          "\"";
 }
 
+bool matches(const Line& wanted, const Line& line) {
+  return wanted.isBsd == line.isBsd && wanted.level == line.level &&
+         (wanted.isBeginning ? line.text.starts_with(wanted.text) : line.text == wanted.text);
+}
+
+// What a request may answer because memory is lacking, and the lines that tell of it.
+struct LackOfMemory {
+  std::vector<KernelReturn> codes;
+  std::vector<const char*> lines;
+};
+
+LackOfMemory lackOfMemoryIn(std::size_t row) {
+  constexpr const char* kNotWritten = "The voicemail store could not be written";
+  constexpr const char* kNotRead = "The voicemail store could not be read";
+  switch (row) {
+    case 0:
+    case 1:
+      return {{5, 6}, {kNotWritten}};
+    case 2:
+    case 3:
+      return {{6}, {kNotWritten}};
+    case 4:
+      return {{5, 6}, {kNotRead}};
+    case 5:
+      return {{6}, {kNotRead}};
+    case 6:
+      return {{5, 6}, {"Preferences: no memory to "}};
+    case 7:
+    case 8:
+      return {{5, 6}, {"Preferences: no memory to "}};
+    // A path of which the policy cannot tell for want of memory is refused.
+    case 9:
+      return {{5, 6, 8}, {"Cannot remove symlink: ", "Preferences: no memory to flush a domain"}};
+    case 11:
+      return {{5, 6, 8}, {"Preferences: no memory to flush a domain"}};
+    case 10:
+    case 12:
+      return {{5, 6}, {}};
+    case 15:
+      return {{6}, {"Destination directory ", "Failed to copy the file "}};
+    case 16:
+      return {{6}, {"Failed to copy the directory "}};
+    case 17:
+      return {{6},
+              {"Destination directory ", "Failed to move the directory ",
+               "Failed to create CarrierBundles Dir "}};
+    case 23:
+      return {{6, 9}, {"Could not create data representation of dictionary", "Could not allocate "}};
+    case 24:
+      return {{5, 6}, {"CopyBadgeLabels, cannot build ", "CopyBadgeLabels, Could not allocate "}};
+    case 25:
+      return {{5, 6}, {"CopyLocalizedLabels, cannot build ", "CopyLocalizedLabels, Could not allocate "}};
+    case 26:
+      return {{6},
+              {"remapChannelIdentifier result: failure : out of memory",
+               "remapChannelIdentifier result: failure : (none)"}};
+    default:
+      return {{6}, {}};
+  }
+}
+
 Expected status(KernelReturn code) { return {{code}, {}, {}, {}}; }
 Expected flagged(bool flag) { return {{0}, flag, {}, {}}; }
 
@@ -138,20 +199,29 @@ Rules::Rules(World& world, const Surroundings& around, Tree files)
 void Rules::expect(const std::string& actor, Line line) { lines_[actor].push_back(std::move(line)); }
 
 void Rules::logs(const std::string& actorName, bool isBsd, int level, std::string text) {
-  if (world_.isKilled() || isUnsure_) return;
+  if (world_.isKilled()) return;
   timePasses();
   const std::string actor = actorName == "com.norvale.httpdownloadqueue" ? kUpdater : actorName;
   if (text.ends_with('\n')) text.pop_back();
   if (text.starts_with("refused ")) return;
   std::deque<Line>& waiting = lines_[actor];
   const Line line{isBsd, level, text};
+  if (isUnsure()) {
+    const auto said = lackOfMemoryIn(*unsureRow_).lines;
+    const auto found =
+        std::find_if(waiting.begin(), waiting.end(), [&](const Line& each) { return matches(each, line); });
+    if (found != waiting.end()) {
+      waiting.erase(waiting.begin(), std::next(found));
+    } else if (std::none_of(said.begin(), said.end(), [&](auto each) { return text.starts_with(each); })) {
+      breach("without memory, a line that nothing asks for: " + described(line));
+    }
+    return;
+  }
   if (waiting.empty()) return breach("on " + actor + ", a line that nothing asks for: " + described(line));
   const Line wanted = waiting.front();
   waiting.pop_front();
-  const bool isRight = wanted.isBsd == isBsd && wanted.level == level &&
-                       (wanted.isBeginning ? text.starts_with(wanted.text) : text == wanted.text);
   if (wanted.isBeginning) lastBeginning_ = text;
-  if (!isRight) {
+  if (!matches(wanted, line)) {
     breach("on " + actor + ", the line " + described(line) + " instead of " + described(wanted));
   }
 }
@@ -227,10 +297,12 @@ void Rules::exits(int status) {
 
 void Rules::wasKilled() {
   isRunning_ = false;
+  unsureRow_.reset();
   lines_.clear();
   pushes_.clear();
   notifications_.clear();
   granted_.clear();
+  maybeGranted_.clear();
   clients_.clear();
   tokens_ = 0;
   idle_.reset();
@@ -284,25 +356,37 @@ void Rules::timePasses() {
 
 // ---- check-in ----
 
-std::vector<KernelReturn> Rules::codesOfCheckIn(std::pair<pid_t, std::uint32_t> process, bool isAlive,
-                                                bool mayCheckIn, bool portIsDead) {
-  const bool isKnown = granted_.contains(process);
-  if (!isKnown && !(isAlive && mayCheckIn)) {
-    // One that has just died may still be remembered.
-    return isAlive || !portIsDead ? std::vector{35} : std::vector{35, 5};
-  }
-  if (around_.outOfDescriptors || portIsDead) return {5};
-  return {0};
+std::vector<KernelReturn> Rules::codesOf(const CheckIn& checkIn) const {
+  const bool isKnown = granted_.contains(checkIn.process);
+  const bool isLetIn = isKnown || (checkIn.isAlive && checkIn.isAllowed);
+  const bool mayBeLetIn = isLetIn || maybeGranted_.contains(checkIn.process);
+  std::vector<KernelReturn> codes;
+  if (mayBeLetIn) codes.push_back(around_.outOfDescriptors || checkIn.portIsDead ? 5 : 0);
+  if (!isLetIn) codes.push_back(35);
+  // One that has just died may still be remembered.
+  if (!isLetIn && !checkIn.isAlive && checkIn.portIsDead) codes.push_back(5);
+  if (!checkIn.lacksMemory) return codes;
+  codes.push_back(6);
+  if (!isKnown) codes.push_back(35);
+  if (mayBeLetIn) codes.push_back(5);
+  return codes;
 }
 
-void Rules::checkedIn(std::pair<pid_t, std::uint32_t> process, int connection, KernelReturn code) {
-  if (code == 35) return;
+void Rules::isAnswered(const CheckIn& checkIn, int connection, KernelReturn code, bool isWatched) {
+  if (code == 35) {
+    maybeGranted_.erase(checkIn.process);
+    return;
+  }
   timePasses();
-  granted_.insert(process);
+  if (!checkIn.lacksMemory) {
+    granted_.insert(checkIn.process);
+  } else if (checkIn.isAlive && checkIn.isAllowed && !granted_.contains(checkIn.process)) {
+    maybeGranted_.insert(checkIn.process);
+  }
   if (code == 0) {
     clients_.insert(connection);
     cancelIdle();
-  } else if (!around_.outOfDescriptors) {
+  } else if (checkIn.lacksMemory ? isWatched : !around_.outOfDescriptors) {
     // The port was dead: the countdown began anew when that was noticed.
     cancelIdle();
     idleSince(world_.now(), world_.now());
@@ -329,6 +413,8 @@ Expected Rules::before(const Call& call) {
       return status(-304);
   }
   if (call.row >= 9 && call.row <= 17) filesBefore_ = files_;
+  // Without memory it is known only afterwards.
+  if (call.failsAt < 0) goesOn(call);
   switch (call.row) {
     case 6:
       return setPreference(call);
@@ -343,9 +429,13 @@ Expected Rules::before(const Call& call) {
     case 11:
       return removeFile(call);
     case 13:
-      return heartbeat(call);
-    case 14:
-      return checkDatabases(call);
+      return status(0);
+    case 14: {
+      std::array<char, 16> mask{};
+      std::snprintf(mask.data(), mask.size(), "%x", static_cast<unsigned>(call.value));
+      info(kMain, std::string("Trying to see if update available for mask ") + mask.data());
+      return status(0);
+    }
     case 15:
       return copyFile(call);
     case 16:
@@ -354,11 +444,12 @@ Expected Rules::before(const Call& call) {
       return moveBundle(call);
     case 18:
       bsdError(kMain, "server_BVMobileHelperRequestCountryCodeFromLocation ");
-      if (call.latitude == 0 && call.longitude == 0) pushCivic({countryCode(kMainTasks), "", "", ""});
       return status(0);
     case 19: {
       Expected expected = status(0);
-      expected.text = countryCode(kMain).substr(0, 64);
+      expected.isRightText = [code = countryCode(kMain).substr(0, 64)](const std::string& text) {
+        return text == code;
+      };
       return expected;
     }
     case 20:
@@ -368,8 +459,10 @@ Expected Rules::before(const Call& call) {
       bsdError(kMain, "Enabling wireless radio manager logs: " + std::to_string(call.value));
       return status(0);
     case 22:
-      if (around_.archiveFatal) bsdError(kMain, "ArkCopier signaled fatal file error");
-      return flagged(around_.archiveResult == 0);
+      if (around_.archiveFatal || call.workerEnd == WorkerEnd::beforeTheWork) {
+        bsdError(kMain, "ArkCopier signaled fatal file error");
+      }
+      return flagged(around_.archiveResult == 0 && call.workerEnd != WorkerEnd::beforeTheWork);
     case 23:
       return loadPlist(call);
     case 24:
@@ -383,6 +476,79 @@ Expected Rules::before(const Call& call) {
   }
 }
 
+// What goes on after the reply.
+void Rules::goesOn(const Call& call) {
+  switch (call.row) {
+    case 13:
+      heartbeats_.emplace_back(world_.now(), call.value != 0);
+      return;
+    case 14:
+      takeToken();
+      checks_.push_back(static_cast<std::uint32_t>(call.value));
+      if (checks_.size() == 1) beginCheck();
+      return;
+    case 18:
+      if (call.latitude == 0 && call.longitude == 0) pushCivic({countryCode(kMainTasks), "", "", ""});
+      return;
+    default:
+      return;
+  }
+}
+
+// ---- lack of memory ----
+
+void Rules::becomesUnsure(const Call& call) { unsureRow_ = call.row; }
+
+Expected Rules::withoutMemory(const Call& call, Expected expected, const Answer& answer) const {
+  const auto codes = lackOfMemoryIn(call.row).codes;
+  expected.codes.insert(expected.codes.end(), codes.begin(), codes.end());
+  const bool tellsByItsByte = (call.row >= 15 && call.row <= 17) || call.row == 22 || call.row == 26;
+  if (tellsByItsByte && answer.flag == false) expected.flag = false;
+  // The routine has one status.
+  if (call.row == 5 && answer.text == "") {
+    expected.isRightText = [](const std::string&) { return true; };
+  }
+  return expected;
+}
+
+void Rules::becomesSure(const Call& call, const Answer& answer, const Tree& disk) {
+  unsureRow_.reset();
+  if (answer.code == 0) goesOn(call);
+  if (answer.code == 0 && call.row == 0) token_ = {cut(call.texts[0], 256, true)};
+  if (answer.code == 0 && call.row == 1)
+    tokenOf(cut(call.texts[0], 256, true)) = {cut(call.texts[1], 256, true)};
+  // A remap that tells of success is done.
+  if (call.row == 26 && answer.flag == true) channels_ = {channels_.back()};
+  if (undo_) (*undo_)();
+  filesSettleOn(disk, false);
+  lines_[kMain].clear();
+}
+
+// ---- the voicemail store ----
+
+void Rules::change(Token& token, const std::string& value, const Call& call) {
+  if (call.failsAt >= 0) {
+    token.insert(value);
+  } else if (call.workerEnd != WorkerEnd::beforeTheWork) {
+    token = {value};
+  }
+}
+
+Expected Rules::readToken(const Call& call, const std::function<Token&()>& token) {
+  Expected expected = status(0);
+  if (call.workerEnd != WorkerEnd::none) {
+    error(kMain, "The voicemail store could not be read");
+    expected.isRightText = [](const std::string& text) { return text.empty(); };
+  } else {
+    expected.isRightText = [token](const std::string& text) {
+      if (!token().contains(text)) return false;
+      token() = {text};  // now it is known which of them it is
+      return true;
+    };
+  }
+  return expected;
+}
+
 Expected Rules::voicemail(const Call& call) {
   std::vector<std::string> texts;
   for (const std::string& each : call.texts) texts.push_back(cut(each, 256, true));
@@ -390,30 +556,32 @@ Expected Rules::voicemail(const Call& call) {
     if (!isUtf8(each)) return status(5);
   }
   Expected expected = status(0);
+  int changes = 1;
   switch (call.row) {
     case 0:
-      token_ = texts[0];
+      change(token_, texts[0], call);
       break;
     case 1:
-      tokens2_[texts[0]] = texts[1];
+      change(tokenOf(texts[0]), texts[1], call);
       break;
     case 2:
-      token_.reset();
+      change(token_, "", call);
       break;
     case 3:
-      token_.reset();
-      tokens2_.clear();
+      change(token_, "", call);
+      for (auto& [key, token] : tokens2_) change(token, "", call);
+      changes = 2;
       break;
-    case 4: {
-      const auto found = tokens2_.find(texts[0]);
-      expected.text = found != tokens2_.end() ? found->second : "";
-      break;
-    }
+    case 4:
+      return readToken(call, [this, key = texts[0]]() -> Token& { return tokenOf(key); });
     case 5:
-      expected.text = token_.value_or("");
-      break;
+      return readToken(call, [this]() -> Token& { return token_; });
     default:
       expected.flag = around_.isSubscribed;
+      return expected;
+  }
+  for (int i = 0; i < changes && call.workerEnd != WorkerEnd::none; ++i) {
+    error(kMain, "The voicemail store could not be written");
   }
   return expected;
 }
@@ -474,7 +642,7 @@ Expected Rules::copyPreference(const Call& call, const char* which) {
     if (values.size() > 1) domains_[domain].keys[key] = {value};
     std::deque<Line>& waiting = lines_[kMain];
     if (payload.empty() && !waiting.empty()) waiting.pop_front();
-    return payload.empty() || isUnsure_ ||
+    return payload.empty() || isUnsure() ||
            lastBeginning_ == "VM_ALLOCATE " + std::to_string(payload.size()) + "l (" + which + ")";
   };
   const bool isThere = std::any_of(values.begin(), values.end(), [](const auto& each) { return !!each; });
@@ -828,9 +996,25 @@ Expected Rules::remap(const Call& call) {
   }
   std::optional<std::string> failure = around_.contactsError;
   if (!isUtf8(from) || !isUtf8(to)) failure = "not UTF-8";
+  if (!failure && call.workerEnd != WorkerEnd::beforeTheWork) {
+    ContactChannels changed = channels_.front();
+    for (auto& [contact, channel] : changed) {
+      if (channel == from) channel = to;
+    }
+    if (call.failsAt < 0) channels_.clear();
+    channels_.push_back(changed);
+  }
+  if (call.workerEnd != WorkerEnd::none) failure = "the contacts could not be reached";
   standard(kMain, std::string("remapChannelIdentifier result: ") + (failure ? "failure" : "success") + " : " +
                       failure.value_or("(none)"));
   return flagged(!failure);
+}
+
+void Rules::comparesWith(const ContactChannels& channels) {
+  if (std::find(channels_.begin(), channels_.end(), channels) == channels_.end()) {
+    breach("the contacts are bound to other channels");
+  }
+  channels_ = {channels};
 }
 
 // ---- location ----
@@ -919,11 +1103,6 @@ void Rules::geoAnswers(bool isCivic, const std::optional<MapItems>& items,
 
 // ---- the heartbeat ----
 
-Expected Rules::heartbeat(const Call& call) {
-  heartbeats_.emplace_back(world_.now(), call.value != 0);
-  return status(0);
-}
-
 void Rules::resolveHeartbeat() {
   while (!heartbeats_.empty()) {
     const auto [since, isOn] = heartbeats_.front();
@@ -944,16 +1123,6 @@ void Rules::resolveHeartbeat() {
 }
 
 // ---- the databases ----
-
-Expected Rules::checkDatabases(const Call& call) {
-  std::array<char, 16> mask{};
-  std::snprintf(mask.data(), mask.size(), "%x", static_cast<unsigned>(call.value));
-  info(kMain, std::string("Trying to see if update available for mask ") + mask.data());
-  takeToken();
-  checks_.push_back(static_cast<std::uint32_t>(call.value));
-  if (checks_.size() == 1) beginCheck();
-  return status(0);
-}
 
 void Rules::beginCheck() {
   info(kUpdater, "Reading local resource com.norvale.lasd");
@@ -1153,13 +1322,6 @@ void Rules::settlesOn(const Tree& disk, const std::string& domain, Domain& there
     }
     values = {value};
   }
-}
-
-void Rules::becomesSure(const Tree& disk) {
-  isUnsure_ = false;
-  if (undo_) (*undo_)();
-  filesSettleOn(disk, false);
-  lines_[kMain].clear();
 }
 
 void Rules::afterDeath(const Tree& disk, bool hadPower) {
