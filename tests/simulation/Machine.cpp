@@ -713,8 +713,7 @@ void Machine::serve(int id, const Call& call) {
   trace("  " + std::to_string(answer.code) + " " + (answer.flag ? (*answer.flag ? "yes" : "no") : "") + " " +
         answer.text.value_or("") + " " + answer.payload.value_or(""));
   if (rules.isUnsure()) {
-    const Expected unsure = rules.withoutMemory(call, expected, answer);
-    check(call, unsure, answer);
+    check(call, rules.withoutMemory(call, expected, answer), answer);
     rules.becomesSure(call, answer, Disk::shared().read());
   } else {
     check(call, expected, answer);

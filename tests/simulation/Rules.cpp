@@ -260,6 +260,7 @@ void Rules::settles() {
       breach("on " + actor + ", a line that never came: " + described(waiting.front()));
     }
   }
+  if (civicWanted_ + addressesWanted_ > 0) breach("a question of a place that never came");
   if (!pushes_.empty()) breach("a push that never came: " + pushes_.front()[0].value_or(""));
   if (!notifications_.empty()) breach("a notification that never came: " + notifications_.front().first);
 }
@@ -307,6 +308,8 @@ void Rules::wasKilled() {
   tokens_ = 0;
   idle_.reset();
   isAwaiting_ = false;
+  civicWanted_ = 0;
+  addressesWanted_ = 0;
   timeOuts_.clear();
   checks_.clear();
   toUpdate_.clear();
@@ -488,7 +491,14 @@ void Rules::goesOn(const Call& call) {
       if (checks_.size() == 1) beginCheck();
       return;
     case 18:
-      if (call.latitude == 0 && call.longitude == 0) pushCivic({countryCode(kMainTasks), "", "", ""});
+      if (call.latitude == 0 && call.longitude == 0) {
+        pushCivic({countryCode(kMainTasks), "", "", ""});
+      } else {
+        ++civicWanted_;
+      }
+      return;
+    case 20:
+      ++addressesWanted_;
       return;
     default:
       return;
@@ -514,6 +524,10 @@ Expected Rules::withoutMemory(const Call& call, Expected expected, const Answer&
 void Rules::becomesSure(const Call& call, const Answer& answer, const Tree& disk) {
   unsureRow_.reset();
   if (answer.code == 0) goesOn(call);
+  // What was done is told of as ever: a line takes no memory.
+  if (answer.code == 0 && answer.flag != false && !lines_[kMain].empty()) {
+    breach("without memory, done without the line " + described(lines_[kMain].front()));
+  }
   if (answer.code == 0 && call.row == 0) token_ = {cut(call.texts[0], 256, true)};
   if (answer.code == 0 && call.row == 1)
     tokenOf(cut(call.texts[0], 256, true)) = {cut(call.texts[1], 256, true)};
@@ -1055,6 +1069,8 @@ void Rules::pushAddress(const std::string& address) {
 void Rules::geoSubmitted(bool isCivic) {
   timePasses();
   isAwaiting_ = true;
+  if (--(isCivic ? civicWanted_ : addressesWanted_) < 0)
+    breach("a question of a place that nobody asked for");
   timeOuts_.emplace_back(world_.now() + kGeoPatience, isCivic);
 }
 

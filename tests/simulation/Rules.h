@@ -270,6 +270,8 @@ class Rules {
   std::set<std::string> unsureFiles_;  // whose copies need not have got to the disk
 
   bool isAwaiting_ = false;
+  int civicWanted_ = 0;  // questions that the geo service has not got yet
+  int addressesWanted_ = 0;
   std::deque<std::pair<Time, bool>> timeOuts_;  // when, and whether of a civic request
 
   std::deque<std::uint32_t> checks_;  // masks; the first one runs
