@@ -148,7 +148,9 @@ std::string labelsOf(Random& random) {
 std::string shortText(Random& random) {
   if (random.oneIn(12)) return std::string(300, 'x');
   if (random.oneIn(12)) return "\xff\xfe";
-  return random.of(std::array<std::string, 4>{"", "a", "token", "\xE2\x82\xAC"});
+  // A long one takes memory.
+  return random.of(std::array<std::string, 6>{"", "a", "token", "\xE2\x82\xAC", "a text that needs memory",
+                                              "another text that needs memory"});
 }
 
 // The one that fails, counted from 0: few requests make more than that.
@@ -169,10 +171,7 @@ CheckInWhims checkInWhims(Random& random) {
   return whims;
 }
 
-Call callOf(Random& random) {
-  Call call;
-  call.row = random.below(kRequestRoutines.size());
-  const RoutineFacts& facts = kRequestRoutines[call.row];
+void setTexts(Random& random, Call& call) {
   switch (call.row) {
     case 0:
     case 4:
@@ -237,23 +236,44 @@ Call callOf(Random& random) {
     default:
       break;
   }
-  if (call.row == 13) call.value = random.oneIn(3) ? 1 : 0;
-  if (call.row == 14) {
-    call.value = random.oneIn(6) ? static_cast<std::int32_t>(random.next())
-                                 : static_cast<std::int32_t>(random.below(32));
+}
+
+void setNumbers(Random& random, Call& call) {
+  switch (call.row) {
+    case 13:
+      call.value = random.oneIn(3) ? 1 : 0;
+      return;
+    case 14:
+      call.value = static_cast<std::int32_t>(random.oneIn(6) ? random.next() : random.below(32));
+      return;
+    case 18:
+      if (random.oneIn(5)) return;
+      call.latitude = 52.5;
+      call.longitude = random.oneIn(4) ? 0 : 13.4;
+      return;
+    case 21:
+      call.value = static_cast<std::int32_t>(random.below(3));
+      return;
+    default:
+      return;
   }
-  if (call.row == 18 && !random.oneIn(5)) {
-    call.latitude = 52.5;
-    call.longitude = random.oneIn(4) ? 0 : 13.4;
+}
+
+Call::Form formOf(Random& random, const RoutineFacts& facts) {
+  if (!random.oneIn(25)) return Call::Form::right;
+  if (facts.descriptors > 0 && random.oneIn(2)) {
+    return random.oneIn(2) ? Call::Form::wrongLength : Call::Form::wrongType;
   }
-  if (call.row == 21) call.value = static_cast<std::int32_t>(random.below(3));
-  if (random.oneIn(25)) {
-    call.form = random.of(
-        std::array{Call::Form::shorter, Call::Form::longer, Call::Form::complexFlag, Call::Form::unknownId});
-    if (facts.descriptors > 0 && random.oneIn(2)) {
-      call.form = random.oneIn(2) ? Call::Form::wrongLength : Call::Form::wrongType;
-    }
-  }
+  return random.of(
+      std::array{Call::Form::shorter, Call::Form::longer, Call::Form::complexFlag, Call::Form::unknownId});
+}
+
+Call callOf(Random& random) {
+  Call call;
+  call.row = random.below(kRequestRoutines.size());
+  setTexts(random, call);
+  setNumbers(random, call);
+  call.form = formOf(random, kRequestRoutines[call.row]);
   constexpr std::array workerRows{0, 1, 2, 3, 4, 5, 22, 26};
   const bool hasWorker =
       std::find(workerRows.begin(), workerRows.end(), static_cast<int>(call.row)) != workerRows.end();
@@ -262,6 +282,31 @@ Call callOf(Random& random) {
     call.failsAt = allocationOf(random);
   } else if (hasWorker && random.oneIn(8)) {
     call.workerEnd = workerEndOf(random);
+  }
+  return call;
+}
+
+// What shows whether a request has done its work: a look at what it was to change, or the same once more.
+Call lookAfter(Call call) {
+  call.failsAt = -1;
+  call.workerEnd = WorkerEnd::none;
+  switch (call.row) {
+    case 0:
+    case 2:
+    case 3:
+      call.row = 5;
+      call.texts.clear();
+      break;
+    case 1:
+      call.row = 4;
+      call.texts.pop_back();
+      break;
+    case 6:
+      call.row = 7;
+      call.regions.clear();
+      break;
+    default:
+      break;
   }
   return call;
 }
@@ -323,6 +368,22 @@ WebAnswer webAnswer(Machine& machine, const std::string& url) {
   return answer;
 }
 
+std::optional<MapItem> mapItemOf(Random& random) {
+  if (random.oneIn(8)) return std::nullopt;
+  MapItem item;
+  item.valid = !random.oneIn(8);
+  if (random.oneIn(8)) return item;
+  item.address = GeoAddress();
+  if (random.oneIn(8)) return item;
+  StructuredAddress address;
+  if (!random.oneIn(3)) address.countryCode = "DE";
+  if (!random.oneIn(3)) address.administrativeArea = "Land";
+  if (!random.oneIn(3)) address.locality = random.oneIn(6) ? "\xff" : "Stadt";
+  if (!random.oneIn(3)) address.postCode = "10117";
+  item.address->structuredAddress = address;
+  return item;
+}
+
 Machine::GeoAnswer geoAnswer(Machine& machine) {
   Random& random = machine.world.random();
   Machine::GeoAnswer answer;
@@ -332,26 +393,7 @@ Machine::GeoAnswer geoAnswer(Machine& machine) {
   answer.address = random.oneIn(5) ? "" : "192.0.2." + std::to_string(random.below(256));
   if (random.oneIn(8)) return answer;  // nothing is known about the place
   answer.items = MapItems();
-  for (std::size_t i = random.below(3); i > 0; --i) {
-    if (random.oneIn(8)) {
-      answer.items->emplace_back();
-      continue;
-    }
-    MapItem item;
-    item.valid = !random.oneIn(8);
-    if (!random.oneIn(8)) {
-      item.address = GeoAddress();
-      if (!random.oneIn(8)) {
-        StructuredAddress address;
-        if (!random.oneIn(3)) address.countryCode = "DE";
-        if (!random.oneIn(3)) address.administrativeArea = "Land";
-        if (!random.oneIn(3)) address.locality = random.oneIn(6) ? "\xff" : "Stadt";
-        if (!random.oneIn(3)) address.postCode = "10117";
-        item.address->structuredAddress = address;
-      }
-    }
-    answer.items->push_back(item);
-  }
+  for (std::size_t i = random.below(3); i > 0; --i) answer.items->push_back(mapItemOf(random));
   return answer;
 }
 
@@ -421,6 +463,16 @@ Process::Holds holdsOf(Random& random) {
                               Process::Holds::number, Process::Holds::unreadable});
 }
 
+void callSome(Machine& machine, Random& random, const std::vector<int>& open) {
+  for (std::size_t i = random.oneIn(8) ? random.below(20) : 1; i > 0; --i) {
+    const int connection = random.of(open);
+    const Call call = callOf(random);
+    machine.call(connection, call);
+    const bool isDoubtful = call.failsAt >= 0 || call.workerEnd != WorkerEnd::none;
+    if (isDoubtful && random.oneIn(2)) machine.call(connection, lookAfter(call));
+  }
+}
+
 void take(Machine& machine, const Step& step) {
   Random random(step.seed);
   machine.rules.settles();
@@ -438,9 +490,7 @@ void take(Machine& machine, const Step& step) {
     const auto form = random.oneIn(8) ? static_cast<CheckInForm>(random.below(8)) : CheckInForm::right;
     machine.checkIn(process, form, checkInWhims(random));
   } else if (what < 78) {
-    for (std::size_t i = random.oneIn(8) ? random.below(20) : 1; i > 0 && !open.empty(); --i) {
-      machine.call(random.of(open), callOf(random));
-    }
+    if (!open.empty()) callSome(machine, random, open);
   } else if (what < 83) {
     if (!open.empty()) machine.close(random.of(open));
   } else if (what < 87) {

@@ -298,28 +298,29 @@ void Machine::surroundingsChange() {
 
 // ---- what happens to the helper ----
 
-void Machine::observe() {
-  if (life_ != nullptr && !world.isKilled()) {
-    Life& life = *life_;
-    for (; life.civicSeen < life.geo.reverseGeocodes.size(); ++life.civicSeen) {
-      rules.geoSubmitted(true);
-      life.civicWaiting.insert(life.civicSeen);
-      const GeoAnswer answer = geoAnswer();
-      if (!answer.delay) continue;
-      world.clock.schedule(*answer.delay, [this, index = life.civicSeen, answer, born = counts.lives] {
-        if (life_ != nullptr && counts.lives == born && !world.isKilled()) answerCivic(index, answer);
-      });
-    }
-    for (; life.addressesSeen < life.geo.geoIps.size(); ++life.addressesSeen) {
-      rules.geoSubmitted(false);
-      life.addressesWaiting.insert(life.addressesSeen);
-      const GeoAnswer answer = geoAnswer();
-      if (!answer.delay) continue;
-      world.clock.schedule(*answer.delay, [this, index = life.addressesSeen, answer, born = counts.lives] {
-        if (life_ != nullptr && counts.lives == born && !world.isKilled()) answerAddress(index, answer);
-      });
-    }
+void Machine::observeQuestions(Life& life) {
+  for (; life.civicSeen < life.geo.reverseGeocodes.size(); ++life.civicSeen) {
+    rules.geoSubmitted(true);
+    life.civicWaiting.insert(life.civicSeen);
+    const GeoAnswer answer = geoAnswer();
+    if (!answer.delay) continue;
+    world.clock.schedule(*answer.delay, [this, index = life.civicSeen, answer, born = counts.lives] {
+      if (life_ != nullptr && counts.lives == born && !world.isKilled()) answerCivic(index, answer);
+    });
   }
+  for (; life.addressesSeen < life.geo.geoIps.size(); ++life.addressesSeen) {
+    rules.geoSubmitted(false);
+    life.addressesWaiting.insert(life.addressesSeen);
+    const GeoAnswer answer = geoAnswer();
+    if (!answer.delay) continue;
+    world.clock.schedule(*answer.delay, [this, index = life.addressesSeen, answer, born = counts.lives] {
+      if (life_ != nullptr && counts.lives == born && !world.isKilled()) answerAddress(index, answer);
+    });
+  }
+}
+
+void Machine::observe() {
+  if (life_ != nullptr && !world.isKilled()) observeQuestions(*life_);
   for (; pushesSeen_ < telephony_.pushes.size(); ++pushesSeen_) {
     const auto& push = telephony_.pushes[pushesSeen_];
     trace("a push of " + push.what);
@@ -650,14 +651,13 @@ void Machine::serve(const ServiceMessage& message) {
   }
 }
 
-void Machine::serve(int id, const Call& call) {
-  if (world.isKilled()) return;
-  const Connection& connection = connections[id];
+namespace {
+
+// Writes the request; returns the size that it claims to have.
+std::uint32_t write(const Call& call, PortName port, std::vector<std::byte>& bytes) {
   const RoutineFacts& facts = kRequestRoutines[call.row];
-  ++counts.calls;
-  auto bytes = buffer();
   auto& header = in<MessageHeader>(bytes);
-  header = {kReplyDisposition, facts.requestSize, 1, connection.port, 0, facts.id};
+  header = {kReplyDisposition, facts.requestSize, 1, port, 0, facts.id};
   std::size_t at = facts.descriptors == 0 ? 32 : facts.descriptors == 1 ? 52 : 76;
   if (facts.descriptors > 0) {
     header.bits |= kComplexBit;
@@ -691,6 +691,18 @@ void Machine::serve(int id, const Call& call) {
   if (call.form == Call::Form::longer) ++size;
   if (call.form == Call::Form::complexFlag) header.bits ^= kComplexBit;
   if (call.form == Call::Form::unknownId) header.id = kFirstRequestId + 27;
+  return size;
+}
+
+}  // namespace
+
+void Machine::serve(int id, const Call& call) {
+  if (world.isKilled()) return;
+  const Connection& connection = connections[id];
+  const RoutineFacts& facts = kRequestRoutines[call.row];
+  ++counts.calls;
+  auto bytes = buffer();
+  const std::uint32_t size = write(call, connection.port, bytes);
 
   rules.timePasses();
   const Expected expected = rules.before(call);

@@ -149,6 +149,7 @@ class Machine final : public LogSink {
   bool wouldEndIn(const std::function<void()>& work);
   void check(const Call& call, const Expected& expected, const Answer& answer);
   void observe();
+  void observeQuestions(Life& life);
   void observeNotifications();
   void answerCivic(std::size_t index, const GeoAnswer& answer);
   void answerAddress(std::size_t index, const GeoAnswer& answer);

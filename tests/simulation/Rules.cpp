@@ -1293,6 +1293,7 @@ bool Rules::installs(const std::string& url, const WebAnswer& answer) {
   }
   if (!answer.body.starts_with("gz:")) {
     error(kUpdater, "Could not uncompress HTTP response to " + temporary + "!");
+    filesBefore_ = files_;
     files_.erase(temporary);
     return fails();
   }
