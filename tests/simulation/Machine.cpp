@@ -330,21 +330,24 @@ void Machine::observe() {
   if (rules.finding()) throw Finding{*rules.finding()};
 }
 
+// The rules learn of an answer when its queue has come to it: what the queue has before may ask again.
 void Machine::answerCivic(std::size_t index, const GeoAnswer& answer) {
   if (life_->civicWaiting.erase(index) == 0) return;
-  rules.geoAnswers(true, answer.error ? std::nullopt : answer.items, std::nullopt, answer.error);
   auto& question = life_->geo.reverseGeocodes[index];
-  if (answer.error) {
-    question.fail(*answer.error);
-  } else {
-    question.answer(answer.items);
+  const auto items = answer.error ? std::nullopt : answer.items;
+  const auto error = answer.error ? std::optional(GeoError{*answer.error}) : std::nullopt;
+  if (const auto queue = question.handlerQueue.lock()) {
+    queue->post([this, items, answer] { rules.geoAnswers(true, items, std::nullopt, answer.error); });
   }
+  question.post(items, error);
 }
 
 void Machine::answerAddress(std::size_t index, const GeoAnswer& answer) {
   if (life_->addressesWaiting.erase(index) == 0) return;
-  rules.geoAnswers(false, std::nullopt, answer.address, answer.error);
   auto& question = life_->geo.geoIps[index];
+  if (const auto queue = question.handlerQueue.lock()) {
+    queue->post([this, answer] { rules.geoAnswers(false, std::nullopt, answer.address, answer.error); });
+  }
   if (answer.error) {
     question.fail(*answer.error);
   } else {
@@ -512,12 +515,13 @@ Answer Machine::dispatch(PortName port, std::vector<std::byte>& bytes, std::uint
   const Request request(bytes.data(), size, &trailer);
   *outcome = Outcome::refused;
   try {
+    // The first request makes what serves them all.
+    const FailingAllocations failing(failsAt < 0 ? std::numeric_limits<long>::max() : failsAt,
+                                     FailingAllocations::HowMany::one);
     const auto handler = source->table.find(request.header().id);
     if (handler == nullptr) {
       reply.setStatus(mig::badId);
     } else {
-      const FailingAllocations failing(failsAt < 0 ? std::numeric_limits<long>::max() : failsAt,
-                                       FailingAllocations::HowMany::one);
       *outcome = handler(source->table.context(), request, reply);
     }
   } catch (const std::bad_alloc&) {
