@@ -153,8 +153,10 @@ std::string shortText(Random& random) {
                                               "another text that needs memory"});
 }
 
-// The one that fails, counted from 0: few requests make more than that.
-long allocationOf(Random& random) { return static_cast<long>(random.below(random.oneIn(2) ? 12 : 80)); }
+// The one that fails, counted from 0: most requests make a few, few make more than that.
+long allocationOf(Random& random) {
+  return static_cast<long>(random.below(random.of(std::array<std::size_t, 3>{4, 12, 80})));
+}
 
 WorkerEnd workerEndOf(Random& random) {
   return random.oneIn(2) ? WorkerEnd::beforeTheWork : WorkerEnd::afterTheWork;
@@ -278,7 +280,7 @@ Call callOf(Random& random) {
   const bool hasWorker =
       std::find(workerRows.begin(), workerRows.end(), static_cast<int>(call.row)) != workerRows.end();
   if (call.form != Call::Form::right) return call;
-  if (random.oneIn(10)) {
+  if (random.oneIn(7)) {
     call.failsAt = allocationOf(random);
   } else if (hasWorker && random.oneIn(8)) {
     call.workerEnd = workerEndOf(random);
