@@ -330,24 +330,21 @@ void Machine::observe() {
   if (rules.finding()) throw Finding{*rules.finding()};
 }
 
-// The rules learn of an answer when its queue has come to it: what the queue has before may ask again.
 void Machine::answerCivic(std::size_t index, const GeoAnswer& answer) {
   if (life_->civicWaiting.erase(index) == 0) return;
+  rules.geoAnswers(true, answer.error ? std::nullopt : answer.items, std::nullopt, answer.error);
   auto& question = life_->geo.reverseGeocodes[index];
-  const auto items = answer.error ? std::nullopt : answer.items;
-  const auto error = answer.error ? std::optional(GeoError{*answer.error}) : std::nullopt;
-  if (const auto queue = question.handlerQueue.lock()) {
-    queue->post([this, items, answer] { rules.geoAnswers(true, items, std::nullopt, answer.error); });
+  if (answer.error) {
+    question.fail(*answer.error);
+  } else {
+    question.answer(answer.items);
   }
-  question.post(items, error);
 }
 
 void Machine::answerAddress(std::size_t index, const GeoAnswer& answer) {
   if (life_->addressesWaiting.erase(index) == 0) return;
+  rules.geoAnswers(false, std::nullopt, answer.address, answer.error);
   auto& question = life_->geo.geoIps[index];
-  if (const auto queue = question.handlerQueue.lock()) {
-    queue->post([this, answer] { rules.geoAnswers(false, std::nullopt, answer.address, answer.error); });
-  }
   if (answer.error) {
     question.fail(*answer.error);
   } else {
@@ -361,10 +358,14 @@ void Machine::networkWorkerDies() {
   ++web.workersDied;
   ++echo.workersDied;
   world.endWaits();
-  const GeoAnswer none{
-      .delay = {}, .items = {}, .address = {}, .error = "the network worker is not available"};
-  while (!life_->civicWaiting.empty()) answerCivic(*life_->civicWaiting.begin(), none);
-  while (!life_->addressesWaiting.empty()) answerAddress(*life_->addressesWaiting.begin(), none);
+  // Noticed a moment later, when what goes on now is done: the rules know no order within one moment.
+  world.clock.schedule(1us + world.random().upTo(1ms), [this, born = counts.lives] {
+    if (life_ == nullptr || counts.lives != born || world.isKilled()) return;
+    GeoAnswer none;
+    none.error = "the network worker is not available";
+    while (!life_->civicWaiting.empty()) answerCivic(*life_->civicWaiting.begin(), none);
+    while (!life_->addressesWaiting.empty()) answerAddress(*life_->addressesWaiting.begin(), none);
+  });
 }
 
 void Machine::observeNotifications() {
