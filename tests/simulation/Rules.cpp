@@ -67,6 +67,10 @@ std::string nameOf(std::string path) {
   while (path.size() > 1 && path.back() == '/') path.pop_back();
   return path.substr(path.rfind('/') + 1);
 }
+Item itemIn(const Tree& tree, const std::string& path) {
+  const auto found = tree.find(path);
+  return found == tree.end() ? Item() : found->second;
+}
 bool isHidden(const std::string& path) {
   return path.starts_with("/root") || path.find("/.brenvik-") != std::string::npos;
 }
@@ -169,24 +173,26 @@ std::string cut(const std::string& field, std::size_t size, bool isTerminated) {
   return text;
 }
 
+// The bytes of the character that begins there; 0 if none does.
+static std::size_t sizeOfCharacter(std::string_view text) {
+  const auto at = [&](std::size_t k) { return static_cast<unsigned char>(text[k]); };
+  if (at(0) < 0x80) return 1;
+  const std::size_t size = at(0) >> 5 == 6 ? 2 : at(0) >> 4 == 14 ? 3 : at(0) >> 3 == 30 ? 4 : 0;
+  if (size == 0 || size > text.size()) return 0;
+  unsigned code = at(0) & (0x7FU >> size);
+  for (std::size_t k = 1; k < size; ++k) {
+    if (at(k) >> 6 != 2) return 0;
+    code = code << 6U | (at(k) & 0x3FU);
+  }
+  constexpr std::array<unsigned, 5> least{0, 0, 0x80, 0x800, 0x10000};
+  return code < least[size] || code > 0x10FFFF || (code >= 0xD800 && code < 0xE000) ? 0 : size;
+}
+
 bool isUtf8(const std::string& text) {
-  for (std::size_t i = 0; i < text.size();) {
-    const auto at = [&](std::size_t k) { return static_cast<unsigned char>(text[k]); };
-    const unsigned char first = at(i);
-    const std::size_t more = first < 0x80       ? 0
-                             : first >> 5 == 6  ? 1
-                             : first >> 4 == 14 ? 2
-                             : first >> 3 == 30 ? 3
-                                                : 9;
-    if (more == 9 || i + more >= text.size() + (more == 0 ? 1 : 0)) return false;
-    unsigned code = more == 0 ? first : first & (0x3FU >> more);
-    for (std::size_t k = 1; k <= more; ++k) {
-      if (at(i + k) >> 6 != 2) return false;
-      code = code << 6U | (at(i + k) & 0x3FU);
-    }
-    constexpr std::array<unsigned, 4> least{0, 0x80, 0x800, 0x10000};
-    if (code < least[more] || code > 0x10FFFF || (code >= 0xD800 && code < 0xE000)) return false;
-    i += more + 1;
+  for (std::string_view left = text; !left.empty();) {
+    const std::size_t size = sizeOfCharacter(left);
+    if (size == 0) return false;
+    left.remove_prefix(size);
   }
   return true;
 }
@@ -664,41 +670,43 @@ Expected Rules::copyPreference(const Call& call, const char* which) {
   return expected;
 }
 
+// The file of a domain of root's.
+Expected Rules::loadDomain(const std::map<std::string, Values>& keys) {
+  Expected expected = status(0);
+  // Without values there need not be a file.
+  const bool mayLack = std::all_of(keys.begin(), keys.end(), [](const auto& each) {
+    return std::find(each.second.begin(), each.second.end(), PropertyList()) != each.second.end();
+  });
+  if (mayLack) {
+    expected.codes = {0, 9};
+    error(kMain, "Could not create data representation of dictionary");
+  }
+  expected.isRightPayload = [this, keys, mayLack](const std::string& payload) {
+    if (mayLack && !lines_[kMain].empty()) lines_[kMain].pop_front();
+    const PropertyList all = parsed(payload);
+    if (!all.is(PropertyList::Type::dictionary)) return false;
+    std::size_t found = 0;
+    for (const auto& [key, values] : keys) {
+      const PropertyList value = all.find(key);
+      if (std::find(values.begin(), values.end(), value) == values.end()) return false;
+      if (value) ++found;
+    }
+    return found == all.size();
+  };
+  return expected;
+}
+
 Expected Rules::loadPlist(const Call& call) {
   const std::string path = cut(call.texts[0], 256, true);
   info(kMain, "Loading " + path + " as plist");
   const std::string folder = "/root/Library/Preferences/";
-  Expected expected = status(0);
   if (path.starts_with(folder) && path.ends_with(".plist")) {
-    const std::string domain = path.substr(folder.size(), path.size() - folder.size() - 6);
-    const auto there = domains_.find(domain);
-    if (there != domains_.end() && there->second.mayHaveFile) {
-      bool mayLack = true;  // without values there need not be a file
-      for (const auto& [key, values] : there->second.keys) {
-        mayLack =
-            mayLack && std::any_of(values.begin(), values.end(), [](const auto& each) { return !each; });
-      }
-      if (mayLack) {
-        expected.codes = {0, 9};
-        expect(kMain, {false, 3, "Could not create data representation of dictionary", false});
-      }
-      expected.isRightPayload = [this, keys = there->second.keys, mayLack](const std::string& payload) {
-        if (mayLack && !lines_[kMain].empty()) lines_[kMain].pop_front();
-        const PropertyList all = parsed(payload);
-        if (!all.is(PropertyList::Type::dictionary)) return false;
-        std::size_t found = 0;
-        for (const auto& [key, values] : keys) {
-          const PropertyList value = all.find(key);
-          if (std::find(values.begin(), values.end(), value) == values.end()) return false;
-          if (value) ++found;
-        }
-        return found == all.size();
-      };
-      return expected;
-    }
+    const auto there = domains_.find(path.substr(folder.size(), path.size() - folder.size() - 6));
+    if (there != domains_.end() && there->second.mayHaveFile) return loadDomain(there->second.keys);
   } else if (const auto found = files_.find(path); found != files_.end() && S_ISREG(found->second.mode)) {
     const PropertyList value = parsed(found->second.content);
     if (value.is(PropertyList::Type::dictionary)) {
+      Expected expected = status(0);
       expected.isRightPayload = [value](const std::string& payload) { return parsed(payload) == value; };
       return expected;
     }
@@ -937,6 +945,34 @@ std::optional<std::string> identifierOf(const std::string& key) {
 
 }  // namespace
 
+std::vector<std::string> Rules::namesIn(const PropertyList& labels) {
+  std::vector<std::string> names;
+  for (std::size_t i = 0; i < labels.size(); ++i) {
+    const auto text = labels.at(i).asString();
+    if (!text) continue;
+    if (const auto found = identifierOf(std::string(*text))) names.push_back(*found);
+  }
+  return names;
+}
+
+// From pairs of a key and a text, of which the key says whether the text counts.
+std::vector<std::string> Rules::badgesIn(const PropertyList& labels) {
+  std::vector<std::string> badges;
+  for (std::size_t i = 0; i < labels.size(); i += 2) {
+    const auto key = labels.at(i).asString();
+    if (!key) {
+      error(kMain, "invalid object in array - ignore the rest");
+      break;
+    }
+    if (!key->empty()) {
+      if (const auto found = identifierOf(std::string(*key))) badges.push_back(*found);
+    } else if (i + 1 < labels.size()) {
+      badges.emplace_back(labels.at(i + 1).asString().value_or("(not a text)"));
+    }
+  }
+  return badges;
+}
+
 Expected Rules::labels(const Call& call, bool badges) {
   const std::string who = badges ? "CopyBadgeLabels" : "CopyLocalizedLabels";
   standard(kMain, who + (badges ? ", compiling badge labels." : ", compiling localized labels.") +
@@ -955,37 +991,15 @@ Expected Rules::labels(const Call& call, bool badges) {
       return status(5);
     }
   }
-  std::vector<std::string> wanted;
-  bool expectsText = false;
-  for (std::size_t i = 0; i < arrays[0].size(); ++i) {
-    const auto text = arrays[0].at(i).asString();
-    if (!badges) {
-      if (!text) continue;
-      if (const auto found = identifierOf(std::string(*text))) wanted.push_back(*found);
-    } else if (expectsText) {
-      wanted.emplace_back(text.value_or("(not a text)"));
-      expectsText = false;
-    } else if (!text) {
-      error(kMain, "invalid object in array - ignore the rest");
-      break;
-    } else if (text->empty()) {
-      expectsText = true;
-    } else {
-      if (const auto found = identifierOf(std::string(*text))) wanted.push_back(*found);
-      ++i;
-    }
+  std::vector<std::string> wanted = badges ? badgesIn(arrays[0]) : namesIn(arrays[0]);
+  if (badges && wanted.empty()) {
+    error(kMain, "no labels given");
+    return status(5);
   }
-  if (badges) {
-    if (wanted.empty()) {
-      error(kMain, "no labels given");
-      return status(5);
-    }
-    standard(kMain,
-             "getLocalizedBadgeLabelsForUnlocalizedLabels, " + std::to_string(wanted.size()) + " label(s)");
-  } else {
-    standard(kMain, "getLocalizedPredefinedLabels, " + std::to_string(arrays[0].size()) + " label(s), " +
-                        std::to_string(arrays[1].size()) + " language(s)");
-  }
+  standard(kMain, badges ? "getLocalizedBadgeLabelsForUnlocalizedLabels, " + std::to_string(wanted.size()) +
+                               " label(s)"
+                         : "getLocalizedPredefinedLabels, " + std::to_string(arrays[0].size()) +
+                               " label(s), " + std::to_string(arrays[1].size()) + " language(s)");
   // The labeler of this machine answers with what it was given, if that is a text.
   std::erase(wanted, "(not a text)");
   Expected expected = status(0);
@@ -1348,6 +1362,26 @@ void Rules::afterDeath(const Tree& disk, bool hadPower) {
   unsureFiles_.clear();
 }
 
+// Whether this may be at the path after what may have ended early.
+bool Rules::mayBeLeft(const std::string& path, const Item& left, bool hadPower) const {
+  // A power cut may take back what was done to an owner or a mode, of which no answer promises more.
+  const auto isSame = [hadPower](const Item& a, const Item& b) {
+    return hadPower ? a == b : (a.mode & S_IFMT) == (b.mode & S_IFMT) && a.content == b.content;
+  };
+  const bool isUnsureOfIt =
+      !hadPower && std::any_of(unsureFiles_.begin(), unsureFiles_.end(), [&](const auto& each) {
+        return path == each || path.starts_with(each + "/");
+      });
+  if (isUnsureOfIt || isSame(left, itemIn(files_, path))) return true;
+  if (!filesBefore_) return false;
+  const Item before = itemIn(*filesBefore_, path);
+  // What is copied or moved is given to root first.
+  const Item given{before.mode, before.content, 0, 0};
+  if (isSame(left, before) || isSame(left, given)) return true;
+  // A database under way: the old one goes before the new one comes, and an unfinished one is left.
+  return path.starts_with(kDatabases + "/") && (left.mode == 0 || path.ends_with(".tmp"));
+}
+
 // The files, after what may have ended early.
 void Rules::filesSettleOn(const Tree& disk, bool hadPower) {
   for (auto each = files_.begin(); each != files_.end();) {
@@ -1359,32 +1393,11 @@ void Rules::filesSettleOn(const Tree& disk, bool hadPower) {
       if (!isHidden(path)) paths.insert(path);
     }
   }
-  const auto itemOf = [](const Tree& tree, const std::string& path) {
-    const auto found = tree.find(path);
-    return found == tree.end() ? Item() : found->second;
-  };
-  // A power cut may take back what was done to an owner or a mode, of which no answer promises more.
-  const auto isSame = [hadPower](const Item& a, const Item& b) {
-    return hadPower ? a == b : (a.mode & S_IFMT) == (b.mode & S_IFMT) && a.content == b.content;
-  };
   for (const std::string& path : paths) {
-    const Item left = itemOf(disk, path);
-    const bool isUnsureOfIt =
-        !hadPower && std::any_of(unsureFiles_.begin(), unsureFiles_.end(), [&](const auto& each) {
-          return path == each || path.starts_with(each + "/");
-        });
-    if (isUnsureOfIt || isSame(left, itemOf(files_, path))) continue;
-    if (filesBefore_) {
-      const Item before = itemOf(*filesBefore_, path);
-      // What is copied or moved is given to root first.
-      const Item given{before.mode, before.content, 0, 0};
-      if (isSame(left, before) || isSame(left, given)) continue;
-    }
-    // A database under way: the old one goes before the new one comes, and an unfinished one is left.
-    if (filesBefore_ && path.starts_with(kDatabases + "/") && (left.mode == 0 || path.ends_with(".tmp")))
-      continue;
+    const Item left = itemIn(disk, path);
+    if (mayBeLeft(path, left, hadPower)) continue;
     breach("after an early end, the file " + path + " is \"" + left.content + "\" instead of \"" +
-           itemOf(files_, path).content + "\"");
+           itemIn(files_, path).content + "\"");
   }
   files_ = disk;
   isAnswered();

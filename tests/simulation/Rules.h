@@ -196,6 +196,7 @@ class Rules {
   void settlesOn(const Tree& disk, const std::string& domain, Domain& there);
 
   // The routines, by their rows.
+  bool mayBeLeft(const std::string& path, const Item& left, bool hadPower) const;
   void filesSettleOn(const Tree& disk, bool hadPower);
 
   void goesOn(const Call& call);
@@ -203,6 +204,7 @@ class Rules {
   Expected setPreference(const Call& call);
   Expected copyPreference(const Call& call, const char* which);
   Expected loadPlist(const Call& call);
+  Expected loadDomain(const std::map<std::string, Values>& keys);
   Expected replaceLink(const Call& call);
   Expected createLink(const Call& call);
   Expected removeFile(const Call& call);
@@ -210,6 +212,8 @@ class Rules {
   Expected copyCrashLogs(const Call& call);
   Expected moveBundle(const Call& call);
   Expected labels(const Call& call, bool badges);
+  static std::vector<std::string> namesIn(const PropertyList& labels);
+  std::vector<std::string> badgesIn(const PropertyList& labels);
   Expected remap(const Call& call);
 
   bool isListed(const std::string& path);
