@@ -465,6 +465,10 @@ Process::Holds holdsOf(Random& random) {
                               Process::Holds::number, Process::Holds::unreadable});
 }
 
+void everybodyExits(Machine& machine) {
+  for (std::size_t i = 0; i < machine.processes.size(); ++i) machine.exits(i);
+}
+
 void callSome(Machine& machine, Random& random, const std::vector<int>& open) {
   for (std::size_t i = random.oneIn(8) ? random.below(20) : 1; i > 0; --i) {
     const int connection = random.of(open);
@@ -500,7 +504,7 @@ void take(Machine& machine, const Step& step) {
   } else if (what < 89) {
     machine.exec(process, holdsOf(random));
   } else if (what < 90) {
-    for (std::size_t i = 0; i < machine.processes.size(); ++i) machine.exits(i);
+    everybodyExits(machine);
   } else if (what < 98) {
     changeSurroundings(machine, random);
   } else {
@@ -545,9 +549,7 @@ Result play(std::uint64_t seed, const std::vector<Step>& steps,
       at += each.gap;
       machine.world.clock.schedule(at, [&machine, each] { take(machine, each); });
     }
-    machine.world.clock.schedule(at + kEnd / 2, [&machine] {
-      for (std::size_t i = 0; i < machine.processes.size(); ++i) machine.exits(i);
-    });
+    machine.world.clock.schedule(at + kEnd / 2, [&machine] { everybodyExits(machine); });
     // A token that was forgotten keeps the helper for ever.
     machine.world.clock.schedule(at + kEnd, [&machine] {
       machine.rules.settles();

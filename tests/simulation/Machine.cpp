@@ -16,6 +16,7 @@
 #include "helper/core/Composition.h"
 #include "platform/base/fakes/FailingAllocations.h"
 #include "platform/files/linux/LinuxFileManager.h"
+#include "platform/log/LogContext.h"
 #include "platform/plist/PropertyListCodec.h"
 #include "platform/preferences/linux/FilePreferences.h"
 
@@ -259,6 +260,12 @@ void Machine::lookForLeaks(Life& life) {
   leaks("receive rights", life.ports.receiveRights.size());
   leaks("send rights", life.ports.sendRights.size());
   leaks("drops of rights that were not there", static_cast<std::size_t>(life.ports.failedDrops));
+  leaks("names of ports in the registry", life.registry.size());
+  const auto isStillNamed = [](const auto& each) {
+    return LogCallers::shared().find(each.second.port) != nullptr;
+  };
+  leaks("callers that the log names",
+        static_cast<std::size_t>(std::count_if(connections.begin(), connections.end(), isStillNamed)));
   leaks("regions", life.regions.live());
   leaks("watches of processes", life.queues.watched());
   leaks("sources", life.sources.livingSources());

@@ -540,7 +540,7 @@ void Rules::becomesSure(const Call& call, const Answer& answer, const Tree& disk
   // A remap that tells of success is done.
   if (call.row == 26 && answer.flag == true) channels_ = {channels_.back()};
   if (undo_) (*undo_)();
-  filesSettleOn(disk, false);
+  filesSettleOn(disk, true);
   lines_[kMain].clear();
 }
 
