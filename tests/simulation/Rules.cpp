@@ -281,6 +281,7 @@ std::string Rules::state() const {
 
 void Rules::begins() {
   isRunning_ = true;
+  hasServed_ = false;
   lines_.clear();
 }
 
@@ -423,7 +424,10 @@ Expected Rules::before(const Call& call) {
   }
   if (call.row >= 9 && call.row <= 17) filesBefore_ = files_;
   // Without memory it is known only afterwards.
-  if (call.failsAt < 0) goesOn(call);
+  if (call.failsAt < 0) {
+    hasServed_ = true;
+    goesOn(call);
+  }
   switch (call.row) {
     case 6:
       return setPreference(call);
@@ -517,7 +521,10 @@ void Rules::becomesUnsure(const Call& call) { unsureRow_ = call.row; }
 
 Expected Rules::withoutMemory(const Call& call, Expected expected, const Answer& answer) const {
   const auto codes = lackOfMemoryIn(call.row).codes;
-  expected.codes.insert(expected.codes.end(), codes.begin(), codes.end());
+  // Once requests are served, lack of memory ends the process here, or there is none.
+  if (!mayEndTheProcess(call) || !hasServed_) {
+    expected.codes.insert(expected.codes.end(), codes.begin(), codes.end());
+  }
   const bool tellsByItsByte = (call.row >= 15 && call.row <= 17) || call.row == 22 || call.row == 26;
   if (tellsByItsByte && answer.flag == false) expected.flag = false;
   // The routine has one status.
@@ -529,16 +536,19 @@ Expected Rules::withoutMemory(const Call& call, Expected expected, const Answer&
 
 void Rules::becomesSure(const Call& call, const Answer& answer, const Tree& disk) {
   unsureRow_.reset();
+  hasServed_ = hasServed_ || answer.code != 6;
   if (answer.code == 0) goesOn(call);
+  const bool isDone = answer.code == 0 && answer.flag != false;
   // What was done is told of as ever: a line takes no memory.
-  if (answer.code == 0 && answer.flag != false && !lines_[kMain].empty()) {
+  if (isDone && !lines_[kMain].empty()) {
     breach("without memory, done without the line " + described(lines_[kMain].front()));
   }
+  if (isDone) isAnswered();
   if (answer.code == 0 && call.row == 0) token_ = {cut(call.texts[0], 256, true)};
-  if (answer.code == 0 && call.row == 1)
+  if (answer.code == 0 && call.row == 1) {
     tokenOf(cut(call.texts[0], 256, true)) = {cut(call.texts[1], 256, true)};
-  // A remap that tells of success is done.
-  if (call.row == 26 && answer.flag == true) channels_ = {channels_.back()};
+  }
+  if (isDone && call.row == 26) channels_ = {channels_.back()};
   if (undo_) (*undo_)();
   filesSettleOn(disk, true);
   lines_[kMain].clear();

@@ -243,6 +243,7 @@ class Rules {
   const Surroundings& around_;
   std::optional<std::string> finding_;
   bool isRunning_ = false;
+  bool hasServed_ = false;  // a request, in this life
   std::optional<std::size_t> unsureRow_;
 
   std::map<std::string, std::deque<Line>> lines_;  // that must come, by the thread
