@@ -165,16 +165,8 @@ LackOfMemory lackOfMemoryIn(std::size_t row) {
 Expected status(KernelReturn code) { return {{code}, {}, {}, {}}; }
 Expected flagged(bool flag) { return {{0}, flag, {}, {}}; }
 
-}  // namespace
-
-std::string cut(const std::string& field, std::size_t size, bool isTerminated) {
-  std::string text = field.substr(0, isTerminated ? size - 1 : size);
-  text.resize(std::min(text.size(), std::strlen(text.c_str())));
-  return text;
-}
-
 // The bytes of the character that begins there; 0 if none does.
-static std::size_t sizeOfCharacter(std::string_view text) {
+std::size_t sizeOfCharacter(std::string_view text) {
   const auto at = [&](std::size_t k) { return static_cast<unsigned char>(text[k]); };
   if (at(0) < 0x80) return 1;
   const std::size_t size = at(0) >> 5 == 6 ? 2 : at(0) >> 4 == 14 ? 3 : at(0) >> 3 == 30 ? 4 : 0;
@@ -186,6 +178,14 @@ static std::size_t sizeOfCharacter(std::string_view text) {
   }
   constexpr std::array<unsigned, 5> least{0, 0, 0x80, 0x800, 0x10000};
   return code < least[size] || code > 0x10FFFF || (code >= 0xD800 && code < 0xE000) ? 0 : size;
+}
+
+}  // namespace
+
+std::string cut(const std::string& field, std::size_t size, bool isTerminated) {
+  std::string text = field.substr(0, isTerminated ? size - 1 : size);
+  text.resize(std::min(text.size(), std::strlen(text.c_str())));
+  return text;
 }
 
 bool isUtf8(const std::string& text) {
