@@ -178,7 +178,7 @@ int FileSystemManager::moveItemWithOwner(const std::string& source, const std::s
 
 int FileSystemManager::moveDirectory(const std::string& source, const std::string& destination) noexcept {
   if (!files().itemExists(source, nullptr)) return kPosixFailure;
-  // What keeps its owner is moved all the same, but not what was not given for want of memory.
+  // What keeps its owner is moved all the same. Without memory, nothing is.
   if (setOwner(source, ::getuid(), ::getgid(), true) == ENOMEM) return ENOMEM;
   return files().moveItem(source, destination, IfPresent::fail, Durability::onReturn).codeOr(kUnexplained);
 }
