@@ -43,9 +43,9 @@ class FileSystemInterface {
   // removed; in the end it is whole at one of the two places.
   virtual int moveItemWithOwner(const std::string& source, const std::string& destination, uid_t uid,
                                 gid_t gid) noexcept = 0;
-  // Gives the whole tree to this process's user and group (ignoring a failure of that), then moves it. Unlike
-  // moveItem it never merges: EEXIST if the destination exists. kPosixFailure if there is no source. On
-  // success everything is on the disk.
+  // Gives the whole tree to this process's user and group (ignoring a failure of that, but for ENOMEM), then
+  // moves it. Unlike moveItem it never merges: EEXIST if the destination exists. kPosixFailure if there is no
+  // source. On success everything is on the disk.
   virtual int moveDirectory(const std::string& source, const std::string& destination) noexcept = 0;
   // Copies an item with its modes, times and extended attributes, by the rules of moveItemWithOwner and for
   // this process's own user and group. The source stays, but that user now owns it.

@@ -178,7 +178,8 @@ int FileSystemManager::moveItemWithOwner(const std::string& source, const std::s
 
 int FileSystemManager::moveDirectory(const std::string& source, const std::string& destination) noexcept {
   if (!files().itemExists(source, nullptr)) return kPosixFailure;
-  (void)setOwner(source, ::getuid(), ::getgid(), true);  // what keeps its owner is moved all the same
+  // What keeps its owner is moved all the same. Without memory, nothing is.
+  if (setOwner(source, ::getuid(), ::getgid(), true) == ENOMEM) return ENOMEM;
   return files().moveItem(source, destination, IfPresent::fail, Durability::onReturn).codeOr(kUnexplained);
 }
 

@@ -368,6 +368,17 @@ TEST_F(FileSystemManagerTest, MoveDirectoryOntoSomethingGives17AndOntoAnUnexplai
   EXPECT_EQ(manager.moveDirectory(dir / "tree", dir / "new"), 5);
 }
 
+TEST_F(FileSystemManagerTest, MoveDirectoryMovesWhatKeepsItsOwnerButNotWhatNoMemoryWasThereToGive) {
+  dir.file("tree/file", "x");
+  files.fail("setAttributesOfTree", FileOutcome::failure(ENOMEM));
+  EXPECT_EQ(manager.moveDirectory(dir / "tree", dir / "moved"), ENOMEM);
+  EXPECT_TRUE(manager.itemExists(dir / "tree/file"));
+  EXPECT_FALSE(manager.itemExists(dir / "moved"));
+  files.fail("setAttributesOfTree", FileOutcome::failure(EPERM));
+  EXPECT_EQ(manager.moveDirectory(dir / "tree", dir / "moved"), 0);
+  EXPECT_TRUE(manager.itemExists(dir / "moved/file"));
+}
+
 TEST_F(FileSystemManagerTest, MoveDirectoryInsideOneFileSystemIsOneRename) {
   dir.file("tree/file", "x");
   const ino_t before = statOf(dir / "tree/file").st_ino;

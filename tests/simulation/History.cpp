@@ -148,13 +148,32 @@ std::string labelsOf(Random& random) {
 std::string shortText(Random& random) {
   if (random.oneIn(12)) return std::string(300, 'x');
   if (random.oneIn(12)) return "\xff\xfe";
-  return random.of(std::array<std::string, 4>{"", "a", "token", "\xE2\x82\xAC"});
+  // A long one takes memory.
+  return random.of(std::array<std::string, 6>{"", "a", "token", "\xE2\x82\xAC", "a text that needs memory",
+                                              "another text that needs memory"});
 }
 
-Call callOf(Random& random) {
-  Call call;
-  call.row = random.below(kRequestRoutines.size());
-  const RoutineFacts& facts = kRequestRoutines[call.row];
+// The one that fails, counted from 0: most requests make a few, few make more than that.
+long allocationOf(Random& random) {
+  return static_cast<long>(random.below(random.of(std::array<std::size_t, 3>{4, 12, 80})));
+}
+
+WorkerEnd workerEndOf(Random& random) {
+  return random.oneIn(2) ? WorkerEnd::beforeTheWork : WorkerEnd::afterTheWork;
+}
+
+CheckInWhims checkInWhims(Random& random) {
+  CheckInWhims whims;
+  whims.diesAtOnce = random.oneIn(12);
+  if (random.oneIn(8)) {
+    whims.failsAt = allocationOf(random);
+  } else if (random.oneIn(10)) {
+    whims.callerWorker = workerEndOf(random);
+  }
+  return whims;
+}
+
+void setTexts(Random& random, Call& call) {
   switch (call.row) {
     case 0:
     case 4:
@@ -219,28 +238,77 @@ Call callOf(Random& random) {
     default:
       break;
   }
-  if (call.row == 13) call.value = random.oneIn(3) ? 1 : 0;
-  if (call.row == 14) {
-    call.value = random.oneIn(6) ? static_cast<std::int32_t>(random.next())
-                                 : static_cast<std::int32_t>(random.below(32));
+}
+
+void setNumbers(Random& random, Call& call) {
+  switch (call.row) {
+    case 13:
+      call.value = random.oneIn(3) ? 1 : 0;
+      return;
+    case 14:
+      call.value = static_cast<std::int32_t>(random.oneIn(6) ? random.next() : random.below(32));
+      return;
+    case 18:
+      if (random.oneIn(5)) return;
+      call.latitude = 52.5;
+      call.longitude = random.oneIn(4) ? 0 : 13.4;
+      return;
+    case 21:
+      call.value = static_cast<std::int32_t>(random.below(3));
+      return;
+    default:
+      return;
   }
-  if (call.row == 18 && !random.oneIn(5)) {
-    call.latitude = 52.5;
-    call.longitude = random.oneIn(4) ? 0 : 13.4;
+}
+
+Call::Form formOf(Random& random, const RoutineFacts& facts) {
+  if (!random.oneIn(25)) return Call::Form::right;
+  if (facts.descriptors > 0 && random.oneIn(2)) {
+    return random.oneIn(2) ? Call::Form::wrongLength : Call::Form::wrongType;
   }
-  if (call.row == 21) call.value = static_cast<std::int32_t>(random.below(3));
-  if (random.oneIn(25)) {
-    call.form = random.of(
-        std::array{Call::Form::shorter, Call::Form::longer, Call::Form::complexFlag, Call::Form::unknownId});
-    if (facts.descriptors > 0 && random.oneIn(2)) {
-      call.form = random.oneIn(2) ? Call::Form::wrongLength : Call::Form::wrongType;
-    }
+  return random.of(
+      std::array{Call::Form::shorter, Call::Form::longer, Call::Form::complexFlag, Call::Form::unknownId});
+}
+
+Call callOf(Random& random) {
+  Call call;
+  call.row = random.below(kRequestRoutines.size());
+  setTexts(random, call);
+  setNumbers(random, call);
+  call.form = formOf(random, kRequestRoutines[call.row]);
+  constexpr std::array workerRows{0, 1, 2, 3, 4, 5, 22, 26};
+  const bool hasWorker =
+      std::find(workerRows.begin(), workerRows.end(), static_cast<int>(call.row)) != workerRows.end();
+  if (call.form != Call::Form::right) return call;
+  if (random.oneIn(7)) {
+    call.failsAt = allocationOf(random);
+  } else if (hasWorker && random.oneIn(8)) {
+    call.workerEnd = workerEndOf(random);
   }
-  // Rows whose fakes can do with a lack of memory, and which leave nothing running.
-  constexpr std::array memoryRows{4, 6, 7, 8, 9, 10, 11, 15, 16, 17, 19, 23};
-  if (call.form == Call::Form::right && random.oneIn(12) &&
-      std::find(memoryRows.begin(), memoryRows.end(), static_cast<int>(call.row)) != memoryRows.end()) {
-    call.failsAt = static_cast<long>(random.below(random.oneIn(2) ? 12 : 80));
+  return call;
+}
+
+// What shows whether a request has done its work: a look at what it was to change, or the same once more.
+Call lookAfter(Call call) {
+  call.failsAt = -1;
+  call.workerEnd = WorkerEnd::none;
+  switch (call.row) {
+    case 0:
+    case 2:
+    case 3:
+      call.row = 5;
+      call.texts.clear();
+      break;
+    case 1:
+      call.row = 4;
+      call.texts.pop_back();
+      break;
+    case 6:
+      call.row = 7;
+      call.regions.clear();
+      break;
+    default:
+      break;
   }
   return call;
 }
@@ -294,11 +362,28 @@ WebAnswer webAnswer(Machine& machine, const std::string& url) {
     machine.rules.manifests[manifest.body] = manifest;
     answer.body = manifest.body;
   } else {
-    answer.body = (random.oneIn(8) ? "gz!" : "gz:") + url + " " + std::to_string(random.below(100));
+    answer.body = (random.oneIn(6) ? random.of(std::array{"gz!", "gz?", "gz."}) : "gz:") + url + " " +
+                  std::to_string(random.below(100));
     if (!random.oneIn(12)) answer.contentType = random.oneIn(9) ? "text/GZIP" : "application/x-gzip";
   }
   if (random.oneIn(15)) answer.body.clear();
   return answer;
+}
+
+std::optional<MapItem> mapItemOf(Random& random) {
+  if (random.oneIn(8)) return std::nullopt;
+  MapItem item;
+  item.valid = !random.oneIn(8);
+  if (random.oneIn(8)) return item;
+  item.address = GeoAddress();
+  if (random.oneIn(8)) return item;
+  StructuredAddress address;
+  if (!random.oneIn(3)) address.countryCode = "DE";
+  if (!random.oneIn(3)) address.administrativeArea = "Land";
+  if (!random.oneIn(3)) address.locality = random.oneIn(6) ? "\xff" : "Stadt";
+  if (!random.oneIn(3)) address.postCode = "10117";
+  item.address->structuredAddress = address;
+  return item;
 }
 
 Machine::GeoAnswer geoAnswer(Machine& machine) {
@@ -310,32 +395,13 @@ Machine::GeoAnswer geoAnswer(Machine& machine) {
   answer.address = random.oneIn(5) ? "" : "192.0.2." + std::to_string(random.below(256));
   if (random.oneIn(8)) return answer;  // nothing is known about the place
   answer.items = MapItems();
-  for (std::size_t i = random.below(3); i > 0; --i) {
-    if (random.oneIn(8)) {
-      answer.items->emplace_back();
-      continue;
-    }
-    MapItem item;
-    item.valid = !random.oneIn(8);
-    if (!random.oneIn(8)) {
-      item.address = GeoAddress();
-      if (!random.oneIn(8)) {
-        StructuredAddress address;
-        if (!random.oneIn(3)) address.countryCode = "DE";
-        if (!random.oneIn(3)) address.administrativeArea = "Land";
-        if (!random.oneIn(3)) address.locality = random.oneIn(6) ? "\xff" : "Stadt";
-        if (!random.oneIn(3)) address.postCode = "10117";
-        item.address->structuredAddress = address;
-      }
-    }
-    answer.items->push_back(item);
-  }
+  for (std::size_t i = random.below(3); i > 0; --i) answer.items->push_back(mapItemOf(random));
   return answer;
 }
 
 void changeSurroundings(Machine& machine, Random& random) {
   Surroundings& around = machine.around;
-  switch (random.below(13)) {
+  switch (random.below(14)) {
     case 0:
       around.countryCode = random.oneIn(3)   ? std::nullopt
                            : random.oneIn(4) ? std::optional(std::string(70, 'c'))
@@ -382,6 +448,9 @@ void changeSurroundings(Machine& machine, Random& random) {
       around.archiveFatal =
           around.archiveResult != 0 && random.oneIn(2) ? std::optional(EINVAL) : std::nullopt;
       break;
+    case 12:
+      machine.networkWorkerDies();
+      break;
     default:
       machine.web.route = random.of(std::array{Route::wifi, Route::wifi, Route::cellular, Route::none});
   }
@@ -396,6 +465,20 @@ Process::Holds holdsOf(Random& random) {
                               Process::Holds::number, Process::Holds::unreadable});
 }
 
+void everybodyExits(Machine& machine) {
+  for (std::size_t i = 0; i < machine.processes.size(); ++i) machine.exits(i);
+}
+
+void callSome(Machine& machine, Random& random, const std::vector<int>& open) {
+  for (std::size_t i = random.oneIn(8) ? random.below(20) : 1; i > 0; --i) {
+    const int connection = random.of(open);
+    const Call call = callOf(random);
+    machine.call(connection, call);
+    const bool isDoubtful = call.failsAt >= 0 || call.workerEnd != WorkerEnd::none;
+    if (isDoubtful && random.oneIn(2)) machine.call(connection, lookAfter(call));
+  }
+}
+
 void take(Machine& machine, const Step& step) {
   Random random(step.seed);
   machine.rules.settles();
@@ -407,15 +490,13 @@ void take(Machine& machine, const Step& step) {
     if (connection.isOpen && connection.port != kNullPort) open.push_back(id);
   }
   if (what < 8 || !hasProcess) {
-    machine.checkIn(machine.spawn(random.oneIn(3) ? 501 : 0, holdsOf(random)), CheckInForm::right,
-                    random.oneIn(15));
+    const uid_t uid = random.oneIn(3) ? 501 : 0;
+    machine.checkIn(machine.spawn(uid, holdsOf(random)), CheckInForm::right, checkInWhims(random));
   } else if (what < 16) {
     const auto form = random.oneIn(8) ? static_cast<CheckInForm>(random.below(8)) : CheckInForm::right;
-    machine.checkIn(process, form, random.oneIn(12));
+    machine.checkIn(process, form, checkInWhims(random));
   } else if (what < 78) {
-    for (std::size_t i = random.oneIn(8) ? random.below(20) : 1; i > 0 && !open.empty(); --i) {
-      machine.call(random.of(open), callOf(random));
-    }
+    if (!open.empty()) callSome(machine, random, open);
   } else if (what < 83) {
     if (!open.empty()) machine.close(random.of(open));
   } else if (what < 87) {
@@ -423,7 +504,7 @@ void take(Machine& machine, const Step& step) {
   } else if (what < 89) {
     machine.exec(process, holdsOf(random));
   } else if (what < 90) {
-    for (std::size_t i = 0; i < machine.processes.size(); ++i) machine.exits(i);
+    everybodyExits(machine);
   } else if (what < 98) {
     changeSurroundings(machine, random);
   } else {
@@ -468,9 +549,7 @@ Result play(std::uint64_t seed, const std::vector<Step>& steps,
       at += each.gap;
       machine.world.clock.schedule(at, [&machine, each] { take(machine, each); });
     }
-    machine.world.clock.schedule(at + kEnd / 2, [&machine] {
-      for (std::size_t i = 0; i < machine.processes.size(); ++i) machine.exits(i);
-    });
+    machine.world.clock.schedule(at + kEnd / 2, [&machine] { everybodyExits(machine); });
     // A token that was forgotten keeps the helper for ever.
     machine.world.clock.schedule(at + kEnd, [&machine] {
       machine.rules.settles();

@@ -11,23 +11,18 @@
 #include "Disk.h"
 #include "Rules.h"
 #include "Services.h"
+#include "Workers.h"
 #include "World.h"
 #include "platform/accounts/fakes/FakeAccountDirectory.h"
 #include "platform/baseband/fakes/FakeBaseband.h"
-#include "platform/contacts/fakes/InMemoryContacts.h"
-#include "platform/files/fakes/ScriptedArchiveCopier.h"
 #include "platform/geo/fakes/ManualGeoService.h"
 #include "platform/ipc/AuditToken.h"
 #include "platform/ipc/fakes/HeapRegions.h"
-#include "platform/labeler/fakes/RecordingLabeler.h"
 #include "platform/log/Log.h"
 #include "platform/messageport/fakes/RecordingMessagePorts.h"
-#include "platform/radio/fakes/FakeRadioManager.h"
-#include "platform/security/fakes/FakeTaskSecurity.h"
 #include "platform/servicemanager/fakes/RecordingServiceManager.h"
 #include "platform/telephony/fakes/RecordingTelephonyDaemon.h"
 #include "platform/voicemail/VisualVoicemail.h"
-#include "platform/voicemail/fakes/InMemoryVoicemailStore.h"
 
 namespace brenvik::simulation {
 
@@ -63,6 +58,14 @@ enum class CheckInForm {
   shortTrailer
 };
 
+// What goes wrong while a check-in is served.
+struct CheckInWhims {
+  bool diesAtOnce = false;  // the caller's port
+  // The allocation that fails, counted from 0; none if it is negative.
+  long failsAt = -1;
+  WorkerEnd callerWorker = WorkerEnd::none;
+};
+
 // How the helper's process comes to its end before its time.
 enum class Disaster { none, killed, powerCut };
 
@@ -83,10 +86,12 @@ class Machine final : public LogSink {
   std::size_t spawn(uid_t uid, Process::Holds holds);
   void exec(std::size_t process, Process::Holds holds);
   void exits(std::size_t process);
-  void checkIn(std::size_t process, CheckInForm form, bool diesAtOnce);
+  void checkIn(std::size_t process, CheckInForm form, const CheckInWhims& whims);
   void close(int connection);
   void call(int connection, const Call& call);
   void serviceMessage(std::size_t process, std::int32_t id);
+  // What it was to answer is never answered. The next question finds another worker.
+  void networkWorkerDies();
   // The next change of the disk, counted from now, is the last thing that the helper does.
   void bringAbout(Disaster disaster, long atChange);
 
@@ -132,17 +137,23 @@ class Machine final : public LogSink {
     int connection;
     CheckInForm form;
     std::int32_t id;
+    CheckInWhims whims;
   };
 
-  void grant(const Process& process);
   void live();
   void serve(const ServiceMessage& message);
   void serve(int connection, const Call& call);
   Answer dispatch(PortName port, std::vector<std::byte>& bytes, std::uint32_t size,
                   const MessageTrailer& trailer, long failsAt, Outcome* outcome);
+  // Whether the process would end in it.
+  bool wouldEndIn(const std::function<void()>& work);
   void check(const Call& call, const Expected& expected, const Answer& answer);
   void observe();
+  void observeQuestions(Life& life);
   void observeNotifications();
+  void answerCivic(std::size_t index, const GeoAnswer& answer);
+  void answerAddress(std::size_t index, const GeoAnswer& answer);
+  std::optional<SecurityTask::Answer> heldBy(const AuditToken& token) const;
   void log(bool isBsd, int level, std::string_view line);
   void strike();
   void lookForLeaks(Life& life);
@@ -150,17 +161,17 @@ class Machine final : public LogSink {
   const std::function<void(const std::string&)> trace_;
   LogSink* const sinkBefore_;
   FakeAccountDirectory accounts_;
-  FakeTaskSecurity security_;
+  SimulatedSecurity security_;
   FakeBasebandLibrary baseband_;
-  FakeRadioManager radio_;
-  RecordingLabeler labeler_;
-  InMemoryContacts contacts_;
+  SimulatedRadio radio_;
+  SimulatedLabeler labeler_;
+  SimulatedContacts contacts_;
   SimulatedGunzip gunzip_;
   RecordingMessagePorts messagePorts_;
-  std::unique_ptr<InMemoryVoicemailStore> voicemail_ = std::make_unique<InMemoryVoicemailStore>();
+  SimulatedVoicemailStore voicemail_;
   RecordingTelephonyDaemon telephony_;
   RecordingServiceManager serviceManager_;
-  ArchiveScript archives_;
+  SimulatedArchives archives_;
 
   std::unique_ptr<Life> life_;
   std::deque<ServiceMessage> waiting_;  // at the service's socket
@@ -171,6 +182,7 @@ class Machine final : public LogSink {
   Disaster disaster_ = Disaster::none;
   std::optional<Tree> remains_;  // of the disk, after a death
   int pendingCalls_ = 0;
+  bool isTrial_ = false;  // of what another process would go through
 };
 
 }  // namespace brenvik::simulation

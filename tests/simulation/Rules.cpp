@@ -67,6 +67,10 @@ std::string nameOf(std::string path) {
   while (path.size() > 1 && path.back() == '/') path.pop_back();
   return path.substr(path.rfind('/') + 1);
 }
+Item itemIn(const Tree& tree, const std::string& path) {
+  const auto found = tree.find(path);
+  return found == tree.end() ? Item() : found->second;
+}
 bool isHidden(const std::string& path) {
   return path.starts_with("/root") || path.find("/.brenvik-") != std::string::npos;
 }
@@ -97,8 +101,84 @@ std::string described(const Line& line) {
          "\"";
 }
 
+bool matches(const Line& wanted, const Line& line) {
+  return wanted.isBsd == line.isBsd && wanted.level == line.level &&
+         (wanted.isBeginning ? line.text.starts_with(wanted.text) : line.text == wanted.text);
+}
+
+// What a request may answer because memory is lacking, and the lines that tell of it.
+struct LackOfMemory {
+  std::vector<KernelReturn> codes;
+  std::vector<const char*> lines;
+};
+
+LackOfMemory lackOfMemoryIn(std::size_t row) {
+  constexpr const char* kNotWritten = "The voicemail store could not be written";
+  constexpr const char* kNotRead = "The voicemail store could not be read";
+  switch (row) {
+    case 0:
+    case 1:
+      return {{5, 6}, {kNotWritten}};
+    case 2:
+    case 3:
+      return {{6}, {kNotWritten}};
+    case 4:
+      return {{5, 6}, {kNotRead}};
+    case 5:
+      return {{6}, {kNotRead}};
+    case 6:
+      return {{5, 6}, {"Preferences: no memory to "}};
+    case 7:
+    case 8:
+      return {{5, 6}, {"Preferences: no memory to "}};
+    // A path of which the policy cannot tell for want of memory is refused.
+    case 9:
+      return {{5, 6, 8}, {"Cannot remove symlink: ", "Preferences: no memory to flush a domain"}};
+    case 11:
+      return {{5, 6, 8}, {"Preferences: no memory to flush a domain"}};
+    case 10:
+    case 12:
+      return {{5, 6}, {}};
+    case 15:
+      return {{6}, {"Destination directory ", "Failed to copy the file "}};
+    case 16:
+      return {{6}, {"Failed to copy the directory "}};
+    case 17:
+      return {{6},
+              {"Destination directory ", "Failed to move the directory ",
+               "Failed to create CarrierBundles Dir "}};
+    case 23:
+      return {{6, 9}, {"Could not create data representation of dictionary", "Could not allocate "}};
+    case 24:
+      return {{5, 6}, {"CopyBadgeLabels, cannot build ", "CopyBadgeLabels, Could not allocate "}};
+    case 25:
+      return {{5, 6}, {"CopyLocalizedLabels, cannot build ", "CopyLocalizedLabels, Could not allocate "}};
+    case 26:
+      return {{6},
+              {"remapChannelIdentifier result: failure : out of memory",
+               "remapChannelIdentifier result: failure : (none)"}};
+    default:
+      return {{6}, {}};
+  }
+}
+
 Expected status(KernelReturn code) { return {{code}, {}, {}, {}}; }
 Expected flagged(bool flag) { return {{0}, flag, {}, {}}; }
+
+// The bytes of the character that begins there; 0 if none does.
+std::size_t sizeOfCharacter(std::string_view text) {
+  const auto at = [&](std::size_t k) { return static_cast<unsigned char>(text[k]); };
+  if (at(0) < 0x80) return 1;
+  const std::size_t size = at(0) >> 5 == 6 ? 2 : at(0) >> 4 == 14 ? 3 : at(0) >> 3 == 30 ? 4 : 0;
+  if (size == 0 || size > text.size()) return 0;
+  unsigned code = at(0) & (0x7FU >> size);
+  for (std::size_t k = 1; k < size; ++k) {
+    if (at(k) >> 6 != 2) return 0;
+    code = code << 6U | (at(k) & 0x3FU);
+  }
+  constexpr std::array<unsigned, 5> least{0, 0, 0x80, 0x800, 0x10000};
+  return code < least[size] || code > 0x10FFFF || (code >= 0xD800 && code < 0xE000) ? 0 : size;
+}
 
 }  // namespace
 
@@ -109,23 +189,10 @@ std::string cut(const std::string& field, std::size_t size, bool isTerminated) {
 }
 
 bool isUtf8(const std::string& text) {
-  for (std::size_t i = 0; i < text.size();) {
-    const auto at = [&](std::size_t k) { return static_cast<unsigned char>(text[k]); };
-    const unsigned char first = at(i);
-    const std::size_t more = first < 0x80       ? 0
-                             : first >> 5 == 6  ? 1
-                             : first >> 4 == 14 ? 2
-                             : first >> 3 == 30 ? 3
-                                                : 9;
-    if (more == 9 || i + more >= text.size() + (more == 0 ? 1 : 0)) return false;
-    unsigned code = more == 0 ? first : first & (0x3FU >> more);
-    for (std::size_t k = 1; k <= more; ++k) {
-      if (at(i + k) >> 6 != 2) return false;
-      code = code << 6U | (at(i + k) & 0x3FU);
-    }
-    constexpr std::array<unsigned, 4> least{0, 0x80, 0x800, 0x10000};
-    if (code < least[more] || code > 0x10FFFF || (code >= 0xD800 && code < 0xE000)) return false;
-    i += more + 1;
+  for (std::string_view left = text; !left.empty();) {
+    const std::size_t size = sizeOfCharacter(left);
+    if (size == 0) return false;
+    left.remove_prefix(size);
   }
   return true;
 }
@@ -138,20 +205,29 @@ Rules::Rules(World& world, const Surroundings& around, Tree files)
 void Rules::expect(const std::string& actor, Line line) { lines_[actor].push_back(std::move(line)); }
 
 void Rules::logs(const std::string& actorName, bool isBsd, int level, std::string text) {
-  if (world_.isKilled() || isUnsure_) return;
+  if (world_.isKilled()) return;
   timePasses();
   const std::string actor = actorName == "com.norvale.httpdownloadqueue" ? kUpdater : actorName;
   if (text.ends_with('\n')) text.pop_back();
   if (text.starts_with("refused ")) return;
   std::deque<Line>& waiting = lines_[actor];
   const Line line{isBsd, level, text};
+  if (isUnsure()) {
+    const auto said = lackOfMemoryIn(*unsureRow_).lines;
+    const auto found =
+        std::find_if(waiting.begin(), waiting.end(), [&](const Line& each) { return matches(each, line); });
+    if (found != waiting.end()) {
+      waiting.erase(waiting.begin(), std::next(found));
+    } else if (std::none_of(said.begin(), said.end(), [&](auto each) { return text.starts_with(each); })) {
+      breach("without memory, a line that nothing asks for: " + described(line));
+    }
+    return;
+  }
   if (waiting.empty()) return breach("on " + actor + ", a line that nothing asks for: " + described(line));
   const Line wanted = waiting.front();
   waiting.pop_front();
-  const bool isRight = wanted.isBsd == isBsd && wanted.level == level &&
-                       (wanted.isBeginning ? text.starts_with(wanted.text) : text == wanted.text);
   if (wanted.isBeginning) lastBeginning_ = text;
-  if (!isRight) {
+  if (!matches(wanted, line)) {
     breach("on " + actor + ", the line " + described(line) + " instead of " + described(wanted));
   }
 }
@@ -190,6 +266,7 @@ void Rules::settles() {
       breach("on " + actor + ", a line that never came: " + described(waiting.front()));
     }
   }
+  if (civicWanted_ + addressesWanted_ > 0) breach("a question of a place that never came");
   if (!pushes_.empty()) breach("a push that never came: " + pushes_.front()[0].value_or(""));
   if (!notifications_.empty()) breach("a notification that never came: " + notifications_.front().first);
 }
@@ -204,6 +281,7 @@ std::string Rules::state() const {
 
 void Rules::begins() {
   isRunning_ = true;
+  hasServed_ = false;
   lines_.clear();
 }
 
@@ -227,14 +305,18 @@ void Rules::exits(int status) {
 
 void Rules::wasKilled() {
   isRunning_ = false;
+  unsureRow_.reset();
   lines_.clear();
   pushes_.clear();
   notifications_.clear();
   granted_.clear();
+  maybeGranted_.clear();
   clients_.clear();
   tokens_ = 0;
   idle_.reset();
   isAwaiting_ = false;
+  civicWanted_ = 0;
+  addressesWanted_ = 0;
   timeOuts_.clear();
   checks_.clear();
   toUpdate_.clear();
@@ -284,25 +366,37 @@ void Rules::timePasses() {
 
 // ---- check-in ----
 
-std::vector<KernelReturn> Rules::codesOfCheckIn(std::pair<pid_t, std::uint32_t> process, bool isAlive,
-                                                bool mayCheckIn, bool portIsDead) {
-  const bool isKnown = granted_.contains(process);
-  if (!isKnown && !(isAlive && mayCheckIn)) {
-    // One that has just died may still be remembered.
-    return isAlive || !portIsDead ? std::vector{35} : std::vector{35, 5};
-  }
-  if (around_.outOfDescriptors || portIsDead) return {5};
-  return {0};
+std::vector<KernelReturn> Rules::codesOf(const CheckIn& checkIn) const {
+  const bool isKnown = granted_.contains(checkIn.process);
+  const bool isLetIn = isKnown || (checkIn.isAlive && checkIn.isAllowed);
+  const bool mayBeLetIn = isLetIn || maybeGranted_.contains(checkIn.process);
+  std::vector<KernelReturn> codes;
+  if (mayBeLetIn) codes.push_back(around_.outOfDescriptors || checkIn.portIsDead ? 5 : 0);
+  if (!isLetIn) codes.push_back(35);
+  // One that has just died may still be remembered.
+  if (!isLetIn && !checkIn.isAlive && checkIn.portIsDead) codes.push_back(5);
+  if (!checkIn.lacksMemory) return codes;
+  codes.push_back(6);
+  if (!isKnown) codes.push_back(35);
+  if (mayBeLetIn) codes.push_back(5);
+  return codes;
 }
 
-void Rules::checkedIn(std::pair<pid_t, std::uint32_t> process, int connection, KernelReturn code) {
-  if (code == 35) return;
+void Rules::isAnswered(const CheckIn& checkIn, int connection, KernelReturn code, bool isWatched) {
+  if (code == 35) {
+    maybeGranted_.erase(checkIn.process);
+    return;
+  }
   timePasses();
-  granted_.insert(process);
+  if (!checkIn.lacksMemory) {
+    granted_.insert(checkIn.process);
+  } else if (checkIn.isAlive && checkIn.isAllowed && !granted_.contains(checkIn.process)) {
+    maybeGranted_.insert(checkIn.process);
+  }
   if (code == 0) {
     clients_.insert(connection);
     cancelIdle();
-  } else if (!around_.outOfDescriptors) {
+  } else if (checkIn.lacksMemory ? isWatched : !around_.outOfDescriptors) {
     // The port was dead: the countdown began anew when that was noticed.
     cancelIdle();
     idleSince(world_.now(), world_.now());
@@ -329,6 +423,11 @@ Expected Rules::before(const Call& call) {
       return status(-304);
   }
   if (call.row >= 9 && call.row <= 17) filesBefore_ = files_;
+  // Without memory it is known only afterwards.
+  if (call.failsAt < 0) {
+    hasServed_ = true;
+    goesOn(call);
+  }
   switch (call.row) {
     case 6:
       return setPreference(call);
@@ -343,9 +442,13 @@ Expected Rules::before(const Call& call) {
     case 11:
       return removeFile(call);
     case 13:
-      return heartbeat(call);
-    case 14:
-      return checkDatabases(call);
+      return status(0);
+    case 14: {
+      std::array<char, 16> mask{};
+      std::snprintf(mask.data(), mask.size(), "%x", static_cast<unsigned>(call.value));
+      info(kMain, std::string("Trying to see if update available for mask ") + mask.data());
+      return status(0);
+    }
     case 15:
       return copyFile(call);
     case 16:
@@ -354,11 +457,12 @@ Expected Rules::before(const Call& call) {
       return moveBundle(call);
     case 18:
       bsdError(kMain, "server_BVMobileHelperRequestCountryCodeFromLocation ");
-      if (call.latitude == 0 && call.longitude == 0) pushCivic({countryCode(kMainTasks), "", "", ""});
       return status(0);
     case 19: {
       Expected expected = status(0);
-      expected.text = countryCode(kMain).substr(0, 64);
+      expected.isRightText = [code = countryCode(kMain).substr(0, 64)](const std::string& text) {
+        return text == code;
+      };
       return expected;
     }
     case 20:
@@ -368,8 +472,10 @@ Expected Rules::before(const Call& call) {
       bsdError(kMain, "Enabling wireless radio manager logs: " + std::to_string(call.value));
       return status(0);
     case 22:
-      if (around_.archiveFatal) bsdError(kMain, "ArkCopier signaled fatal file error");
-      return flagged(around_.archiveResult == 0);
+      if (around_.archiveFatal || call.workerEnd == WorkerEnd::beforeTheWork) {
+        bsdError(kMain, "ArkCopier signaled fatal file error");
+      }
+      return flagged(around_.archiveResult == 0 && call.workerEnd != WorkerEnd::beforeTheWork);
     case 23:
       return loadPlist(call);
     case 24:
@@ -383,6 +489,96 @@ Expected Rules::before(const Call& call) {
   }
 }
 
+// What goes on after the reply.
+void Rules::goesOn(const Call& call) {
+  switch (call.row) {
+    case 13:
+      heartbeats_.emplace_back(world_.now(), call.value != 0);
+      return;
+    case 14:
+      takeToken();
+      checks_.push_back(static_cast<std::uint32_t>(call.value));
+      if (checks_.size() == 1) beginCheck();
+      return;
+    case 18:
+      if (call.latitude == 0 && call.longitude == 0) {
+        pushCivic({countryCode(kMainTasks), "", "", ""});
+      } else {
+        ++civicWanted_;
+      }
+      return;
+    case 20:
+      ++addressesWanted_;
+      return;
+    default:
+      return;
+  }
+}
+
+// ---- lack of memory ----
+
+void Rules::becomesUnsure(const Call& call) { unsureRow_ = call.row; }
+
+Expected Rules::withoutMemory(const Call& call, Expected expected, const Answer& answer) const {
+  const auto codes = lackOfMemoryIn(call.row).codes;
+  // Once requests are served, lack of memory ends the process here, or there is none.
+  if (!mayEndTheProcess(call) || !hasServed_) {
+    expected.codes.insert(expected.codes.end(), codes.begin(), codes.end());
+  }
+  const bool tellsByItsByte = (call.row >= 15 && call.row <= 17) || call.row == 22 || call.row == 26;
+  if (tellsByItsByte && answer.flag == false) expected.flag = false;
+  // The routine has one status.
+  if (call.row == 5 && answer.text == "") {
+    expected.isRightText = [](const std::string&) { return true; };
+  }
+  return expected;
+}
+
+void Rules::becomesSure(const Call& call, const Answer& answer, const Tree& disk) {
+  unsureRow_.reset();
+  hasServed_ = hasServed_ || answer.code != 6;
+  if (answer.code == 0) goesOn(call);
+  const bool isDone = answer.code == 0 && answer.flag != false;
+  // What was done is told of as ever: a line takes no memory.
+  if (isDone && !lines_[kMain].empty()) {
+    breach("without memory, done without the line " + described(lines_[kMain].front()));
+  }
+  if (isDone) isAnswered();
+  if (answer.code == 0 && call.row == 0) token_ = {cut(call.texts[0], 256, true)};
+  if (answer.code == 0 && call.row == 1) {
+    tokenOf(cut(call.texts[0], 256, true)) = {cut(call.texts[1], 256, true)};
+  }
+  if (isDone && call.row == 26) channels_ = {channels_.back()};
+  if (undo_) (*undo_)();
+  filesSettleOn(disk, true);
+  lines_[kMain].clear();
+}
+
+// ---- the voicemail store ----
+
+void Rules::change(Token& token, const std::string& value, const Call& call) {
+  if (call.failsAt >= 0) {
+    token.insert(value);
+  } else if (call.workerEnd != WorkerEnd::beforeTheWork) {
+    token = {value};
+  }
+}
+
+Expected Rules::readToken(const Call& call, const std::function<Token&()>& token) {
+  Expected expected = status(0);
+  if (call.workerEnd != WorkerEnd::none) {
+    error(kMain, "The voicemail store could not be read");
+    expected.isRightText = [](const std::string& text) { return text.empty(); };
+  } else {
+    expected.isRightText = [token](const std::string& text) {
+      if (!token().contains(text)) return false;
+      token() = {text};  // now it is known which of them it is
+      return true;
+    };
+  }
+  return expected;
+}
+
 Expected Rules::voicemail(const Call& call) {
   std::vector<std::string> texts;
   for (const std::string& each : call.texts) texts.push_back(cut(each, 256, true));
@@ -390,30 +586,32 @@ Expected Rules::voicemail(const Call& call) {
     if (!isUtf8(each)) return status(5);
   }
   Expected expected = status(0);
+  int changes = 1;
   switch (call.row) {
     case 0:
-      token_ = texts[0];
+      change(token_, texts[0], call);
       break;
     case 1:
-      tokens2_[texts[0]] = texts[1];
+      change(tokenOf(texts[0]), texts[1], call);
       break;
     case 2:
-      token_.reset();
+      change(token_, "", call);
       break;
     case 3:
-      token_.reset();
-      tokens2_.clear();
+      change(token_, "", call);
+      for (auto& [key, token] : tokens2_) change(token, "", call);
+      changes = 2;
       break;
-    case 4: {
-      const auto found = tokens2_.find(texts[0]);
-      expected.text = found != tokens2_.end() ? found->second : "";
-      break;
-    }
+    case 4:
+      return readToken(call, [this, key = texts[0]]() -> Token& { return tokenOf(key); });
     case 5:
-      expected.text = token_.value_or("");
-      break;
+      return readToken(call, [this]() -> Token& { return token_; });
     default:
       expected.flag = around_.isSubscribed;
+      return expected;
+  }
+  for (int i = 0; i < changes && call.workerEnd != WorkerEnd::none; ++i) {
+    error(kMain, "The voicemail store could not be written");
   }
   return expected;
 }
@@ -474,7 +672,7 @@ Expected Rules::copyPreference(const Call& call, const char* which) {
     if (values.size() > 1) domains_[domain].keys[key] = {value};
     std::deque<Line>& waiting = lines_[kMain];
     if (payload.empty() && !waiting.empty()) waiting.pop_front();
-    return payload.empty() || isUnsure_ ||
+    return payload.empty() || isUnsure() ||
            lastBeginning_ == "VM_ALLOCATE " + std::to_string(payload.size()) + "l (" + which + ")";
   };
   const bool isThere = std::any_of(values.begin(), values.end(), [](const auto& each) { return !!each; });
@@ -482,41 +680,43 @@ Expected Rules::copyPreference(const Call& call, const char* which) {
   return expected;
 }
 
+// The file of a domain of root's.
+Expected Rules::loadDomain(const std::map<std::string, Values>& keys) {
+  Expected expected = status(0);
+  // Without values there need not be a file.
+  const bool mayLack = std::all_of(keys.begin(), keys.end(), [](const auto& each) {
+    return std::find(each.second.begin(), each.second.end(), PropertyList()) != each.second.end();
+  });
+  if (mayLack) {
+    expected.codes = {0, 9};
+    error(kMain, "Could not create data representation of dictionary");
+  }
+  expected.isRightPayload = [this, keys, mayLack](const std::string& payload) {
+    if (mayLack && !lines_[kMain].empty()) lines_[kMain].pop_front();
+    const PropertyList all = parsed(payload);
+    if (!all.is(PropertyList::Type::dictionary)) return false;
+    std::size_t found = 0;
+    for (const auto& [key, values] : keys) {
+      const PropertyList value = all.find(key);
+      if (std::find(values.begin(), values.end(), value) == values.end()) return false;
+      if (value) ++found;
+    }
+    return found == all.size();
+  };
+  return expected;
+}
+
 Expected Rules::loadPlist(const Call& call) {
   const std::string path = cut(call.texts[0], 256, true);
   info(kMain, "Loading " + path + " as plist");
   const std::string folder = "/root/Library/Preferences/";
-  Expected expected = status(0);
   if (path.starts_with(folder) && path.ends_with(".plist")) {
-    const std::string domain = path.substr(folder.size(), path.size() - folder.size() - 6);
-    const auto there = domains_.find(domain);
-    if (there != domains_.end() && there->second.mayHaveFile) {
-      bool mayLack = true;  // without values there need not be a file
-      for (const auto& [key, values] : there->second.keys) {
-        mayLack =
-            mayLack && std::any_of(values.begin(), values.end(), [](const auto& each) { return !each; });
-      }
-      if (mayLack) {
-        expected.codes = {0, 9};
-        expect(kMain, {false, 3, "Could not create data representation of dictionary", false});
-      }
-      expected.isRightPayload = [this, keys = there->second.keys, mayLack](const std::string& payload) {
-        if (mayLack && !lines_[kMain].empty()) lines_[kMain].pop_front();
-        const PropertyList all = parsed(payload);
-        if (!all.is(PropertyList::Type::dictionary)) return false;
-        std::size_t found = 0;
-        for (const auto& [key, values] : keys) {
-          const PropertyList value = all.find(key);
-          if (std::find(values.begin(), values.end(), value) == values.end()) return false;
-          if (value) ++found;
-        }
-        return found == all.size();
-      };
-      return expected;
-    }
+    const auto there = domains_.find(path.substr(folder.size(), path.size() - folder.size() - 6));
+    if (there != domains_.end() && there->second.mayHaveFile) return loadDomain(there->second.keys);
   } else if (const auto found = files_.find(path); found != files_.end() && S_ISREG(found->second.mode)) {
     const PropertyList value = parsed(found->second.content);
     if (value.is(PropertyList::Type::dictionary)) {
+      Expected expected = status(0);
       expected.isRightPayload = [value](const std::string& payload) { return parsed(payload) == value; };
       return expected;
     }
@@ -755,6 +955,34 @@ std::optional<std::string> identifierOf(const std::string& key) {
 
 }  // namespace
 
+std::vector<std::string> Rules::namesIn(const PropertyList& labels) {
+  std::vector<std::string> names;
+  for (std::size_t i = 0; i < labels.size(); ++i) {
+    const auto text = labels.at(i).asString();
+    if (!text) continue;
+    if (const auto found = identifierOf(std::string(*text))) names.push_back(*found);
+  }
+  return names;
+}
+
+// From pairs of a key and a text, of which the key says whether the text counts.
+std::vector<std::string> Rules::badgesIn(const PropertyList& labels) {
+  std::vector<std::string> badges;
+  for (std::size_t i = 0; i < labels.size(); i += 2) {
+    const auto key = labels.at(i).asString();
+    if (!key) {
+      error(kMain, "invalid object in array - ignore the rest");
+      break;
+    }
+    if (!key->empty()) {
+      if (const auto found = identifierOf(std::string(*key))) badges.push_back(*found);
+    } else if (i + 1 < labels.size()) {
+      badges.emplace_back(labels.at(i + 1).asString().value_or("(not a text)"));
+    }
+  }
+  return badges;
+}
+
 Expected Rules::labels(const Call& call, bool badges) {
   const std::string who = badges ? "CopyBadgeLabels" : "CopyLocalizedLabels";
   standard(kMain, who + (badges ? ", compiling badge labels." : ", compiling localized labels.") +
@@ -773,37 +1001,15 @@ Expected Rules::labels(const Call& call, bool badges) {
       return status(5);
     }
   }
-  std::vector<std::string> wanted;
-  bool expectsText = false;
-  for (std::size_t i = 0; i < arrays[0].size(); ++i) {
-    const auto text = arrays[0].at(i).asString();
-    if (!badges) {
-      if (!text) continue;
-      if (const auto found = identifierOf(std::string(*text))) wanted.push_back(*found);
-    } else if (expectsText) {
-      wanted.emplace_back(text.value_or("(not a text)"));
-      expectsText = false;
-    } else if (!text) {
-      error(kMain, "invalid object in array - ignore the rest");
-      break;
-    } else if (text->empty()) {
-      expectsText = true;
-    } else {
-      if (const auto found = identifierOf(std::string(*text))) wanted.push_back(*found);
-      ++i;
-    }
+  std::vector<std::string> wanted = badges ? badgesIn(arrays[0]) : namesIn(arrays[0]);
+  if (badges && wanted.empty()) {
+    error(kMain, "no labels given");
+    return status(5);
   }
-  if (badges) {
-    if (wanted.empty()) {
-      error(kMain, "no labels given");
-      return status(5);
-    }
-    standard(kMain,
-             "getLocalizedBadgeLabelsForUnlocalizedLabels, " + std::to_string(wanted.size()) + " label(s)");
-  } else {
-    standard(kMain, "getLocalizedPredefinedLabels, " + std::to_string(arrays[0].size()) + " label(s), " +
-                        std::to_string(arrays[1].size()) + " language(s)");
-  }
+  standard(kMain, badges ? "getLocalizedBadgeLabelsForUnlocalizedLabels, " + std::to_string(wanted.size()) +
+                               " label(s)"
+                         : "getLocalizedPredefinedLabels, " + std::to_string(arrays[0].size()) +
+                               " label(s), " + std::to_string(arrays[1].size()) + " language(s)");
   // The labeler of this machine answers with what it was given, if that is a text.
   std::erase(wanted, "(not a text)");
   Expected expected = status(0);
@@ -828,9 +1034,25 @@ Expected Rules::remap(const Call& call) {
   }
   std::optional<std::string> failure = around_.contactsError;
   if (!isUtf8(from) || !isUtf8(to)) failure = "not UTF-8";
+  if (!failure && call.workerEnd != WorkerEnd::beforeTheWork) {
+    ContactChannels changed = channels_.front();
+    for (auto& [contact, channel] : changed) {
+      if (channel == from) channel = to;
+    }
+    if (call.failsAt < 0) channels_.clear();
+    channels_.push_back(changed);
+  }
+  if (call.workerEnd != WorkerEnd::none) failure = "the contacts could not be reached";
   standard(kMain, std::string("remapChannelIdentifier result: ") + (failure ? "failure" : "success") + " : " +
                       failure.value_or("(none)"));
   return flagged(!failure);
+}
+
+void Rules::comparesWith(const ContactChannels& channels) {
+  if (std::find(channels_.begin(), channels_.end(), channels) == channels_.end()) {
+    breach("the contacts are bound to other channels");
+  }
+  channels_ = {channels};
 }
 
 // ---- location ----
@@ -871,6 +1093,8 @@ void Rules::pushAddress(const std::string& address) {
 void Rules::geoSubmitted(bool isCivic) {
   timePasses();
   isAwaiting_ = true;
+  if (--(isCivic ? civicWanted_ : addressesWanted_) < 0)
+    breach("a question of a place that nobody asked for");
   timeOuts_.emplace_back(world_.now() + kGeoPatience, isCivic);
 }
 
@@ -919,11 +1143,6 @@ void Rules::geoAnswers(bool isCivic, const std::optional<MapItems>& items,
 
 // ---- the heartbeat ----
 
-Expected Rules::heartbeat(const Call& call) {
-  heartbeats_.emplace_back(world_.now(), call.value != 0);
-  return status(0);
-}
-
 void Rules::resolveHeartbeat() {
   while (!heartbeats_.empty()) {
     const auto [since, isOn] = heartbeats_.front();
@@ -944,16 +1163,6 @@ void Rules::resolveHeartbeat() {
 }
 
 // ---- the databases ----
-
-Expected Rules::checkDatabases(const Call& call) {
-  std::array<char, 16> mask{};
-  std::snprintf(mask.data(), mask.size(), "%x", static_cast<unsigned>(call.value));
-  info(kMain, std::string("Trying to see if update available for mask ") + mask.data());
-  takeToken();
-  checks_.push_back(static_cast<std::uint32_t>(call.value));
-  if (checks_.size() == 1) beginCheck();
-  return status(0);
-}
 
 void Rules::beginCheck() {
   info(kUpdater, "Reading local resource com.norvale.lasd");
@@ -1108,6 +1317,7 @@ bool Rules::installs(const std::string& url, const WebAnswer& answer) {
   }
   if (!answer.body.starts_with("gz:")) {
     error(kUpdater, "Could not uncompress HTTP response to " + temporary + "!");
+    filesBefore_ = files_;
     files_.erase(temporary);
     return fails();
   }
@@ -1155,18 +1365,31 @@ void Rules::settlesOn(const Tree& disk, const std::string& domain, Domain& there
   }
 }
 
-void Rules::becomesSure(const Tree& disk) {
-  isUnsure_ = false;
-  if (undo_) (*undo_)();
-  filesSettleOn(disk, false);
-  lines_[kMain].clear();
-}
-
 void Rules::afterDeath(const Tree& disk, bool hadPower) {
   if (undo_) (*undo_)();
   for (auto& [domain, there] : domains_) settlesOn(disk, domain, there);
   filesSettleOn(disk, hadPower);
   unsureFiles_.clear();
+}
+
+// Whether this may be at the path after what may have ended early.
+bool Rules::mayBeLeft(const std::string& path, const Item& left, bool hadPower) const {
+  // A power cut may take back what was done to an owner or a mode, of which no answer promises more.
+  const auto isSame = [hadPower](const Item& a, const Item& b) {
+    return hadPower ? a == b : (a.mode & S_IFMT) == (b.mode & S_IFMT) && a.content == b.content;
+  };
+  const bool isUnsureOfIt =
+      !hadPower && std::any_of(unsureFiles_.begin(), unsureFiles_.end(), [&](const auto& each) {
+        return path == each || path.starts_with(each + "/");
+      });
+  if (isUnsureOfIt || isSame(left, itemIn(files_, path))) return true;
+  if (!filesBefore_) return false;
+  const Item before = itemIn(*filesBefore_, path);
+  // What is copied or moved is given to root first.
+  const Item given{before.mode, before.content, 0, 0};
+  if (isSame(left, before) || isSame(left, given)) return true;
+  // A database under way: the old one goes before the new one comes, and an unfinished one is left.
+  return path.starts_with(kDatabases + "/") && (left.mode == 0 || path.ends_with(".tmp"));
 }
 
 // The files, after what may have ended early.
@@ -1180,32 +1403,11 @@ void Rules::filesSettleOn(const Tree& disk, bool hadPower) {
       if (!isHidden(path)) paths.insert(path);
     }
   }
-  const auto itemOf = [](const Tree& tree, const std::string& path) {
-    const auto found = tree.find(path);
-    return found == tree.end() ? Item() : found->second;
-  };
-  // A power cut may take back what was done to an owner or a mode, of which no answer promises more.
-  const auto isSame = [hadPower](const Item& a, const Item& b) {
-    return hadPower ? a == b : (a.mode & S_IFMT) == (b.mode & S_IFMT) && a.content == b.content;
-  };
   for (const std::string& path : paths) {
-    const Item left = itemOf(disk, path);
-    const bool isUnsureOfIt =
-        !hadPower && std::any_of(unsureFiles_.begin(), unsureFiles_.end(), [&](const auto& each) {
-          return path == each || path.starts_with(each + "/");
-        });
-    if (isUnsureOfIt || isSame(left, itemOf(files_, path))) continue;
-    if (filesBefore_) {
-      const Item before = itemOf(*filesBefore_, path);
-      // What is copied or moved is given to root first.
-      const Item given{before.mode, before.content, 0, 0};
-      if (isSame(left, before) || isSame(left, given)) continue;
-    }
-    // A database under way: the old one goes before the new one comes, and an unfinished one is left.
-    if (filesBefore_ && path.starts_with(kDatabases + "/") && (left.mode == 0 || path.ends_with(".tmp")))
-      continue;
+    const Item left = itemIn(disk, path);
+    if (mayBeLeft(path, left, hadPower)) continue;
     breach("after an early end, the file " + path + " is \"" + left.content + "\" instead of \"" +
-           itemOf(files_, path).content + "\"");
+           itemIn(files_, path).content + "\"");
   }
   files_ = disk;
   isAnswered();

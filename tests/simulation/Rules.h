@@ -16,6 +16,7 @@
 
 #include "Disk.h"
 #include "Services.h"
+#include "Workers.h"
 #include "World.h"
 #include "interface/Wire.h"
 #include "platform/geo/GeoService.h"
@@ -46,6 +47,17 @@ struct Call {
   Form form = Form::right;
   // The allocation that fails while it is served, counted from 0; none if it is negative.
   long failsAt = -1;
+  // How the worker that it needs ends.
+  WorkerEnd workerEnd = WorkerEnd::none;
+};
+
+// A check-in, as far as its answer follows from it.
+struct CheckIn {
+  std::pair<pid_t, std::uint32_t> process;
+  bool isAlive = true;
+  bool isAllowed = true;  // what can be found out of the living process lets it in
+  bool portIsDead = false;
+  bool lacksMemory = false;  // one allocation fails while it is served
 };
 
 // A reply, or what a reply must be.
@@ -59,7 +71,7 @@ struct Answer {
 struct Expected {
   std::vector<KernelReturn> codes;
   std::optional<bool> flag;
-  std::optional<std::string> text;
+  std::function<bool(const std::string& text)> isRightText;
   std::function<bool(const std::string& payload)> isRightPayload;
 };
 
@@ -104,17 +116,23 @@ class Rules {
   void afterDeath(const Tree& disk, bool hadPower);
   // Whether the files are as they must be.
   void comparesWith(const Tree& disk);
+  // Whether the contacts are bound as they must be.
+  void comparesWith(const ContactChannels& channels);
+  const ContactChannels& channels() const { return channels_.front(); }
   // Before anything else happens at this moment.
   void timePasses();
   // At a moment at which nothing is left to be done.
   void settles();
 
   // ---- check-in ----
-  // The codes that it may get; `isAllowed` is what the entitlement files say of the living process.
-  std::vector<KernelReturn> codesOfCheckIn(std::pair<pid_t, std::uint32_t> process, bool isAlive,
-                                           bool isAllowed, bool portIsDead);
-  void checkedIn(std::pair<pid_t, std::uint32_t> process, int connection, KernelReturn code);
-  void processExits(std::pair<pid_t, std::uint32_t> process) { granted_.erase(process); }
+  // The codes that it may get.
+  std::vector<KernelReturn> codesOf(const CheckIn& checkIn) const;
+  // `isWatched`: the helper watches the caller's port now.
+  void isAnswered(const CheckIn& checkIn, int connection, KernelReturn code, bool isWatched);
+  void processExits(std::pair<pid_t, std::uint32_t> process) {
+    granted_.erase(process);
+    maybeGranted_.erase(process);
+  }
   void portDies(int connection);
 
   // ---- requests ----
@@ -124,11 +142,15 @@ class Rules {
     undo_.reset();
     filesBefore_.reset();
   }
-  // Between the two, memory is short: the request may fail, and its lines may be missing; what it did is done
-  // or not.
-  void becomesUnsure() { isUnsure_ = true; }
-  void becomesSure(const Tree& disk);
-  bool isUnsure() const noexcept { return isUnsure_; }
+  // Between the two, memory is short: the request may fail, and lines may be missing; what it did is done or
+  // not.
+  void becomesUnsure(const Call& call);
+  void becomesSure(const Call& call, const Answer& answer, const Tree& disk);
+  // What its answer may be then.
+  Expected withoutMemory(const Call& call, Expected expected, const Answer& answer) const;
+  // Whether lack of memory may end the process in it.
+  static bool mayEndTheProcess(const Call& call) noexcept { return call.row == 18 || call.row == 20; }
+  bool isUnsure() const noexcept { return unsureRow_.has_value(); }
 
   // ---- what the helper does ----
   void logs(const std::string& actor, bool isBsd, int level, std::string text);
@@ -174,12 +196,15 @@ class Rules {
   void settlesOn(const Tree& disk, const std::string& domain, Domain& there);
 
   // The routines, by their rows.
+  bool mayBeLeft(const std::string& path, const Item& left, bool hadPower) const;
   void filesSettleOn(const Tree& disk, bool hadPower);
 
+  void goesOn(const Call& call);
   Expected voicemail(const Call& call);
   Expected setPreference(const Call& call);
   Expected copyPreference(const Call& call, const char* which);
   Expected loadPlist(const Call& call);
+  Expected loadDomain(const std::map<std::string, Values>& keys);
   Expected replaceLink(const Call& call);
   Expected createLink(const Call& call);
   Expected removeFile(const Call& call);
@@ -187,9 +212,9 @@ class Rules {
   Expected copyCrashLogs(const Call& call);
   Expected moveBundle(const Call& call);
   Expected labels(const Call& call, bool badges);
+  static std::vector<std::string> namesIn(const PropertyList& labels);
+  std::vector<std::string> badgesIn(const PropertyList& labels);
   Expected remap(const Call& call);
-  Expected heartbeat(const Call& call);
-  Expected checkDatabases(const Call& call);
 
   bool isListed(const std::string& path);
   bool isAllowed(const std::string& path);
@@ -218,7 +243,8 @@ class Rules {
   const Surroundings& around_;
   std::optional<std::string> finding_;
   bool isRunning_ = false;
-  bool isUnsure_ = false;
+  bool hasServed_ = false;  // a request, in this life
+  std::optional<std::size_t> unsureRow_;
 
   std::map<std::string, std::deque<Line>> lines_;  // that must come, by the thread
   std::string lastBeginning_;                      // the last line of which the rules know the beginning
@@ -226,6 +252,7 @@ class Rules {
   std::deque<std::pair<std::string, std::string>> notifications_;
 
   std::set<std::pair<pid_t, std::uint32_t>> granted_;
+  std::set<std::pair<pid_t, std::uint32_t>> maybeGranted_;  // remembered, unless memory was lacking
   std::set<int> clients_;
   int tokens_ = 0;
   struct Idle {
@@ -235,12 +262,21 @@ class Rules {
   std::optional<Idle> idle_;  // the next tick
 
   std::map<std::string, Domain> domains_;
-  std::optional<std::string> token_;
-  std::map<std::string, std::string> tokens2_;
+  // What a token may be, each as good as the other; none is as an empty one.
+  using Token = std::set<std::string>;
+  static void change(Token& token, const std::string& value, const Call& call);
+  Expected readToken(const Call& call, const std::function<Token&()>& token);
+  Token& tokenOf(const std::string& key) { return tokens2_.try_emplace(key, Token{""}).first->second; }
+  Token token_{""};
+  std::map<std::string, Token> tokens2_;
+  // What the contacts may be bound to.
+  std::vector<ContactChannels> channels_{{{1, "a"}, {2, "token"}, {3, "a"}, {4, "\xE2\x82\xAC"}}};
   Tree files_;
   std::set<std::string> unsureFiles_;  // whose copies need not have got to the disk
 
   bool isAwaiting_ = false;
+  int civicWanted_ = 0;  // questions that the geo service has not got yet
+  int addressesWanted_ = 0;
   std::deque<std::pair<Time, bool>> timeOuts_;  // when, and whether of a civic request
 
   std::deque<std::uint32_t> checks_;  // masks; the first one runs

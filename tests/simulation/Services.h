@@ -4,10 +4,12 @@
 
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstring>
 #include <functional>
 #include <map>
 #include <memory>
+#include <new>
 #include <optional>
 #include <set>
 #include <span>
@@ -18,7 +20,10 @@
 #include "World.h"
 #include "platform/gzip/Gunzip.h"
 #include "platform/ipc/fakes/FakePorts.h"
+#include "platform/labeler/SubscriptionLabeler.h"
 #include "platform/net/EchoNetwork.h"
+#include "platform/plist/PropertyList.h"
+#include "platform/radio/RadioManager.h"
 #include "platform/web/WebClient.h"
 
 // The services of the machine that the fakes beside the platform's roles are too kind for: those that take
@@ -48,6 +53,7 @@ class SimulatedWeb final : public WebClient {
   std::function<void(const std::string& url)> onSend;
   std::function<void(const std::string& url, const WebAnswer& answer)> onAnswer;
   std::function<void(const std::string& text)> onBreach;
+  int workersDied = 0;  // so far; a request under way has no answer then
 
   std::shared_ptr<WebSession> makeSession() override { return std::make_shared<Session>(); }
   std::shared_ptr<WebRequest> makeRequest(WebRequestType, const std::string& url, const HeaderMap&,
@@ -77,8 +83,14 @@ class SimulatedWeb::Request final : public WebRequest {
     if (web_.world_.isKilled()) return completion_(nullptr);
     web_.onSend(url_);
     WebAnswer sent = web_.throughTheAir(*session_, web_.answer(url_));
+    const int diedBefore = web_.workersDied;
     web_.world_.waitFor(sent.delay);
     sent = web_.throughTheAir(*session_, std::move(sent));
+    if (web_.workersDied != diedBefore) {
+      sent = WebAnswer();
+      sent.kind = WebErrorKind::clientUnavailable;
+      sent.status = 0;
+    }
     if (web_.world_.isKilled()) return completion_(nullptr);
     web_.onAnswer(url_, sent);
     const auto isDone = std::make_shared<bool>(false);
@@ -125,20 +137,22 @@ inline WebAnswer SimulatedWeb::throughTheAir(const Session& session, WebAnswer s
   return sent;
 }
 
-// A gzip file is "gz:" and its content here; "gz!" is one that is damaged in the middle.
+// A gzip file is "gz:" and its content here; "gz!" is one that is damaged in the middle. At "gz?" the worker
+// dies in the middle of it, at "gz." when it has written everything.
 class SimulatedGunzip final : public Gunzip {
  public:
   GunzipOutcome gunzipInto(const GunzipInput& input, int file, std::uint64_t room,
                            std::uint64_t) noexcept override {
     const std::string_view bytes(reinterpret_cast<const char*>(input.bytes.data()), input.bytes.size());
     if (bytes.empty()) return {GunzipResult::truncated, 0, 0};
-    const bool isWhole = bytes.starts_with("gz:");
+    const bool isWhole = bytes.starts_with("gz:") || bytes.starts_with("gz.");
     const std::string_view content = bytes.substr(std::min<std::size_t>(3, bytes.size()));
     if (content.size() > room) return {GunzipResult::whole, content.size(), 0};
     const std::string_view written = isWhole ? content : content.substr(0, content.size() / 2);
     if (::write(file, written.data(), written.size()) != static_cast<ssize_t>(written.size())) {
       return {GunzipResult::refused, 0, errno};
     }
+    if (bytes.starts_with("gz?") || bytes.starts_with("gz.")) return {GunzipResult::unavailable, 0, 0};
     return {isWhole ? GunzipResult::whole : GunzipResult::damaged, written.size(), 0};
   }
 };
@@ -152,15 +166,18 @@ class SimulatedEcho final : public EchoNetwork {
   Far far = Far::answers;
   bool hasCellular = true;
   std::function<void(unsigned interface, std::span<const std::byte> message)> onSend;
+  // Asked at each step of a probe: whether the worker dies at it.
+  std::function<bool()> dies;
+  int workersDied = 0;  // so far; the sockets that were open then are of no use any more
   int openSockets = 0;
 
   std::optional<in_addr> addressOfHost(const char*) override { return std::nullopt; }
-  std::optional<int> protocolByName(const char*) override { return 1; }
+  std::optional<int> protocolByName(const char*) override { return dies() ? std::nullopt : std::optional(1); }
   std::unique_ptr<EchoSocket> openEchoSocket(int, std::uint16_t) override {
-    return std::make_unique<Socket>(*this);
+    return dies() ? nullptr : std::make_unique<Socket>(*this);
   }
   unsigned indexOfInterface(const char* name) override {
-    return hasCellular && std::strcmp(name, "pdp_ip0") == 0 ? 7 : 0;
+    return !dies() && hasCellular && std::strcmp(name, "pdp_ip0") == 0 ? 7 : 0;
   }
   int timeOfDay(timeval* now) noexcept override {
     const auto time = std::chrono::duration_cast<std::chrono::microseconds>(world_.now()).count();
@@ -183,9 +200,10 @@ class SimulatedEcho final : public EchoNetwork {
     void bindToInterface(unsigned index) override { interface_ = index; }
     int setReceiveTimeOut(std::chrono::microseconds timeOut) override {
       timeOut_ = timeOut;
-      return 0;
+      return isDead() ? EPIPE : 0;
     }
     EchoTransfer sendTo(in_addr, std::span<const std::byte> message) override {
+      if (isDead()) return {-1, EPIPE};
       if (echo_.onSend) echo_.onSend(interface_, message);
       if (echo_.far == Far::isUnreachable) return {-1, ENETUNREACH};
       sent_.assign(message.begin(), message.end());
@@ -193,9 +211,10 @@ class SimulatedEcho final : public EchoNetwork {
     }
     EchoTransfer receive(std::span<std::byte> buffer) override {
       if (echo_.world_.isKilled()) return {-1, EIO};
+      if (isDead()) return {-1, EPIPE};
       if (echo_.far != Far::answers || sent_.size() > buffer.size()) {
         echo_.world_.waitFor(timeOut_);
-        return {-1, EAGAIN};
+        return {-1, echo_.workersDied != diedBefore_ ? EPIPE : EAGAIN};
       }
       std::copy(sent_.begin(), sent_.end(), buffer.begin());
       buffer[0] = std::byte{0};  // the reply to an echo request
@@ -204,12 +223,41 @@ class SimulatedEcho final : public EchoNetwork {
     bool deliversIpHeader() const noexcept override { return false; }
 
    private:
+    bool isDead() { return echo_.dies() || echo_.workersDied != diedBefore_; }
     SimulatedEcho& echo_;
+    const int diedBefore_ = echo_.workersDied;
     unsigned interface_ = 0;
     std::chrono::microseconds timeOut_{0};
     std::vector<std::byte> sent_;
   };
   World& world_;
+};
+
+// The radio manager's switch.
+class SimulatedRadio final : public RadioManager {
+ public:
+  void setLogToFile(bool enable) noexcept override { isOn = enable; }
+  std::optional<bool> isOn;
+};
+
+// A labeler without languages: a label is its own text.
+class SimulatedLabeler final : public SubscriptionLabeler {
+ public:
+  PropertyList localizedBadgeLabels(const PropertyList& labels, const PropertyList&) override {
+    return textsOf(labels);
+  }
+  PropertyList localizedLabels(const PropertyList& labels, const PropertyList&) override {
+    return textsOf(labels);
+  }
+
+ private:
+  static PropertyList textsOf(const PropertyList& labels) {
+    std::vector<PropertyList> texts;
+    for (std::size_t i = 0; i < labels.size(); ++i) {
+      if (labels.at(i).asString().has_value()) texts.push_back(labels.at(i));
+    }
+    return PropertyList::array(std::move(texts));
+  }
 };
 
 // Sources of the machine's ports. A port that has died is told of from the main loop, whenever it is watched.
@@ -219,21 +267,25 @@ class SimulatedPortSources final : public PortSources {
   bool refuses = false;  // the machine is out of descriptors
 
   std::shared_ptr<RoutineSource> makeRoutineSource(PortName port, const RoutineTable& table,
-                                                   WantTrailer trailer) noexcept override {
+                                                   WantTrailer trailer) noexcept override try {
     if (refuses || !ports_.receiveRights.contains(port)) return nullptr;
     auto source = std::make_shared<FakeRoutineSource>(port, table, trailer);
     routines_[port] = source;
     return source;
+  } catch (const std::bad_alloc&) {
+    return nullptr;
   }
-  std::shared_ptr<DeathWatch> makeDeathWatch(PortName port, RunLoop&) noexcept override {
+  std::shared_ptr<DeathWatch> makeDeathWatch(PortName port, RunLoop&) noexcept override try {
     if (refuses || !ports_.sendRights.contains(port)) return nullptr;
     auto watch = std::make_shared<FakeDeathWatch>(port);
     watches_[port] = watch;
     if (dead_.contains(port)) {
-      watch->died = true;
       tell(watch);
+      watch->died = true;
     }
     return watch;
+  } catch (const std::bad_alloc&) {
+    return nullptr;
   }
 
   // The source that serves the port now, or null.
@@ -241,6 +293,10 @@ class SimulatedPortSources final : public PortSources {
     const auto found = routines_.find(port);
     const auto source = found != routines_.end() ? found->second.lock() : nullptr;
     return source != nullptr && source->added && source->valid ? source : nullptr;
+  }
+  bool isWatched(PortName port) const {
+    const auto found = watches_.find(port);
+    return found != watches_.end() && !found->second.expired();
   }
   void portDies(PortName port) {
     dead_.insert(port);

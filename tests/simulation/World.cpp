@@ -87,6 +87,10 @@ void World::waitFor(Time delay) {
   clock.cancel(wake);  // a kill ends the wait early, and then the queue
 }
 
+void World::endWaits() noexcept {
+  for (SimulatedQueue* each : queues_) each->isWoken_ = each->state_ == SimulatedQueue::State::waiting;
+}
+
 const std::string& World::actor() const noexcept { return current_ != nullptr ? current_->label() : actor_; }
 
 bool World::isQuiet(std::string_view label) const noexcept {

@@ -123,6 +123,8 @@ class World {
   // Called on a queue's thread: lets the others go on for so long. It returns at once when the helper has
   // been killed.
   void waitFor(Time delay);
+  // Ends the waits of all queues: what they wait for has gone.
+  void endWaits() noexcept;
   // The label of the queue whose task runs, "main tasks" for a task of the main queue, else "main".
   const std::string& actor() const noexcept;
   // Whether no queue of the helper has anything to do.

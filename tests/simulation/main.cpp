@@ -21,6 +21,9 @@ using brenvik::simulation::Result;
 // The seed that is being played, for a death of the program.
 volatile std::uint64_t seedNow = 0;
 
+// In seconds; most take some hundredths of one. A helper that waits for what never comes ends here.
+constexpr unsigned kLongestHistory = 120;
+
 void tellSeed(int signal) {
   char text[64];
   const int length = std::snprintf(text, sizeof text, "died of signal %d at seed %llu\n", signal,
@@ -60,6 +63,7 @@ bool read(int count, char** words, Options& options) {
 }
 
 void tell(std::uint64_t seed, const Result& result) {
+  (void)::alarm(0);
   std::printf("seed %llu: %s\n", static_cast<unsigned long long>(seed), result.finding->c_str());
   const auto steps = brenvik::simulation::stepsOf(seed);
   const auto fewer = brenvik::simulation::shrink(seed, steps, *result.finding);
@@ -87,7 +91,7 @@ int main(int count, char** words) {
     std::fprintf(stderr, "cannot make a file system of its own (%s)\n", error.what());
     return 77;
   }
-  for (const int signal : {SIGSEGV, SIGABRT, SIGBUS, SIGFPE}) (void)std::signal(signal, tellSeed);
+  for (const int signal : {SIGSEGV, SIGABRT, SIGBUS, SIGFPE, SIGALRM}) (void)std::signal(signal, tellSeed);
 
   using Clock = std::chrono::steady_clock;
   const auto begin = Clock::now();
@@ -99,6 +103,7 @@ int main(int count, char** words) {
        options.minutes > 0 ? elapsed() < options.minutes * 60 : histories < options.seeds;
        ++seed, ++histories) {
     seedNow = seed;
+    (void)::alarm(kLongestHistory);
     const auto steps = brenvik::simulation::stepsOf(seed);
     Result result =
         play(seed, steps,
