@@ -46,6 +46,9 @@ bool failsNow() {
   }
   throw std::bad_alloc();
 }
+[[gnu::noinline]] void* operator new(std::size_t size, const std::nothrow_t&) noexcept {
+  return failsNow() ? nullptr : std::malloc(size == 0 ? 1 : size);
+}
 [[gnu::noinline]] void operator delete(void* block) noexcept { std::free(block); }
 [[gnu::noinline]] void operator delete(void* block, std::size_t) noexcept { std::free(block); }
 
