@@ -30,6 +30,8 @@ BUILD = pathlib.Path(os.environ["BRENVIK_BUILD"])
 DAEMON = BUILD / "BrenvikMobileHelper"
 # A sanitizer keeps freed memory for a while, and its own besides: what is measured then is not the daemon's.
 SANITIZED = any(name in DAEMON.read_bytes() for name in (b"__asan_init", b"__tsan_init"))
+# By how much an emulator makes the daemon slower: limits of time are so much longer.
+SLOWNESS = float(os.environ.get("BRENVIK_SLOWNESS", "1"))
 SOCKET = pathlib.Path(wire.BOOTSTRAP) / wire.SERVICE
 ENTITLEMENTS = pathlib.Path("/etc/brenvik/entitlements.d")
 ALLOW = "com.norvale.Teravox.BrenvikHelper.allow"

@@ -13,9 +13,9 @@ import time
 import traceback
 
 import wire
-from harness import ERROR, HelperTest, as_account, eventually, main, refused_with, stop_process
+from harness import ERROR, SLOWNESS, HelperTest, as_account, eventually, main, refused_with, stop_process
 
-LONGEST_CALL = 0.1  # seconds, of a client that is checked in, while others do what they like
+LONGEST_CALL = 0.1 * SLOWNESS  # seconds, of a client that is checked in, while others do what they like
 CHECK_IN_REFUSED = "out of descriptors or memory: a check-in was refused"
 
 

@@ -270,9 +270,10 @@ TEST_F(SystemQueuesTest, TicksThatWereMissedAreDroppedAndTheRhythmStays) {
   const auto start = Clock::now();
   const auto timer = loop->addTimer(kInterval, kInterval, [&] { ticks.push_back(Clock::now()); }, {});
   std::this_thread::sleep_until(start + 5 * kInterval);
-  runUntil([&] { return ticks.size() == 2; });
+  runUntil([&] { return ticks.size() == 3; });
   EXPECT_GE(ticks[0] - start, 5 * kInterval);
-  EXPECT_GE(ticks[1] - start, 6 * kInterval) << "the five that were missed are one";
+  // The second may follow at once: the rhythm began a moment after `start`, which is long on a slow machine.
+  EXPECT_GE(ticks[2] - start, 6 * kInterval) << "the five that were missed are one";
 }
 
 TEST_F(SystemQueuesTest, ATimerFarBeyondAnyClockIsMadeAndNeverFires) {
