@@ -91,11 +91,15 @@ macro(brenvik_static_runtime program)
   if(BRENVIK_STATIC_RUNTIME)
     # By hand instead of with -static-libstdc++, which puts -lm behind the C++ library: parts of that, which the linker
     # drops again, ask for it, and then every start loads it for nothing. Here it is for our own code. See
-    # docs/decisions/16-start.md.
+    # docs/decisions/16-start.md. A build that is not optimised drops no parts, so there it comes behind as well.
+    set(behind)
+    if(CMAKE_BUILD_TYPE MATCHES "^(Debug)?$")
+      set(behind " -lm")
+    endif()
     target_link_options(${program} PRIVATE -nodefaultlibs)
     # The only libraries that are sure to come last on the command line are those of the folder.
     set(CMAKE_CXX_STANDARD_LIBRARIES
-        "-lm -Wl,-Bstatic -lstdc++ -Wl,-Bdynamic -Wl,--start-group -lgcc -lgcc_eh -lc -Wl,--end-group")
+        "-lm -Wl,-Bstatic -lstdc++ -Wl,-Bdynamic -Wl,--start-group -lgcc -lgcc_eh -lc -Wl,--end-group${behind}")
   endif()
 endmacro()
 
