@@ -327,6 +327,14 @@ def stop_process(pid):
     eventually(lambda: not runs(), what="the stop of every thread")
 
 
+def has_ended(pid):
+    """Whether its first thread has ended, waited for or not."""
+    try:
+        return "State:\tZ" in pathlib.Path(f"/proc/{pid}/status").read_text(encoding="ascii")
+    except (FileNotFoundError, ProcessLookupError):
+        return True
+
+
 def kill_process(pid):
     """Kills a process of anybody's; returns when its last thread has ended, and with it closed what the process held.
 

@@ -7,7 +7,7 @@ import random
 import re
 import time
 
-from harness import ERROR, LOG_ERR, SANITIZED, as_account, eventually, kill_process, main, open_files, stop_process
+from harness import ERROR, LOG_ERR, SANITIZED, as_account, eventually, has_ended, kill_process, main, open_files, stop_process
 from intrusion import tell_ways_into
 from test_lasd import ALL, DIRECTORY, HOST, UpdateTest, request_check
 from test_location import Brenvik, LocationTest, civic
@@ -85,8 +85,7 @@ class Updates(WorkerTest, UpdateTest):
         worker = self.daemon.network_worker()
         self.daemon.process.kill()
         self.daemon.process.wait()
-        eventually(lambda: not pathlib.Path(f"/proc/{worker}/exe").exists() or
-                   "State:\tZ" in pathlib.Path(f"/proc/{worker}/status").read_text(), what="the worker's end")
+        eventually(lambda: has_ended(worker), what="the worker's end")
 
     def test_killed_during_a_fetch_the_request_fails_at_once_and_the_next_one_is_served(self):
         self.server.stop()
