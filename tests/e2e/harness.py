@@ -212,6 +212,17 @@ class Daemon:
     def descriptors(self):
         return len(os.listdir(f"/proc/{self.pid}/fd"))
 
+    def settled_descriptors(self):
+        """How many it has when it has done all that was asked of it."""
+        seen = []
+
+        def settled():
+            seen.append(self.descriptors())
+            time.sleep(0.02)
+            return len(seen) > 10 and len(set(seen[-10:])) == 1
+        eventually(settled, what="descriptors that stay")
+        return seen[-1]
+
     def sockets(self):
         """How many of its descriptors are sockets: what a connection costs, without what is opened once and kept."""
         return sum(each.startswith("socket:") for each in open_files(self.pid))

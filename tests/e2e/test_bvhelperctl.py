@@ -616,7 +616,7 @@ class Life(ToolTest):
         # The first leaves what is made once: the areas, and the queue on which exits are handled.
         self.assertEqual(run("prefs", "get", "d", "k").returncode, 3)  # nothing is there
         eventually(lambda: "global" in self.daemon.threads(), what="its exit being handled")
-        before = self.daemon.descriptors()
+        before = self.daemon.settled_descriptors()
         for _ in range(30):
             self.assertEqual(run("prefs", "get", "d", "k").returncode, 3)  # nothing is there
         eventually(lambda: self.daemon.descriptors() <= before, what="the descriptors back where they were")

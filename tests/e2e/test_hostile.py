@@ -61,7 +61,7 @@ class HostileClients(HelperTest):
         bad = self.client()
         value = plistlib.dumps("value")
         self.assert_served()
-        before = self.daemon.descriptors()
+        before = self.daemon.settled_descriptors()
         unsealed = [wire.memfd_of(value, seals) for seals in (0, 0x2, 0x4 | 0x8, 0x2 | 0x4)]
         sealed = wire.memfd_of(value)
         zero = os.open("/dev/zero", os.O_RDONLY)
@@ -108,7 +108,7 @@ class HostileClients(HelperTest):
         # The first caller to exit leaves the queue behind on which exits are handled.
         self.assertEqual(as_account("root", lambda: wire.Client().close() or 0), 0)
         eventually(lambda: "global" in self.daemon.threads(), what="the exit being handled")
-        before = self.settled_descriptors()
+        before = self.daemon.settled_descriptors()
         for what in (signal.SIGSTOP, signal.SIGKILL):
             pid = os.fork()
             if pid == 0:
@@ -164,7 +164,7 @@ class HostileClients(HelperTest):
 
     def test_a_client_whose_end_nobody_could_notice_is_not_let_in(self):
         self.assert_served()
-        before = self.settled_descriptors()
+        before = self.daemon.settled_descriptors()
         with socket.socket(socket.AF_UNIX, socket.SOCK_SEQPACKET) as listening:
             listening.bind("\0never-hangs-up")
             listening.listen()
@@ -177,7 +177,7 @@ class HostileClients(HelperTest):
 
     def test_a_client_that_the_helper_itself_would_keep_alive_is_not_let_in(self):
         self.assert_served()
-        before = self.settled_descriptors()
+        before = self.daemon.settled_descriptors()
         message = wire.check_in_message()
         failure = 5
         service, another = wire.connect(), wire.connect()
@@ -194,17 +194,6 @@ class HostileClients(HelperTest):
         self.good.close()
         self.assertEqual(self.daemon.wait(), 0, "nobody holds the process")
 
-    def settled_descriptors(self):
-        """How many it has when it has done all that was asked of it."""
-        seen = []
-
-        def settled():
-            seen.append(self.daemon.descriptors())
-            time.sleep(0.02)
-            return len(seen) > 10 and len(set(seen[-10:])) == 1
-        eventually(settled, what="descriptors that stay")
-        return seen[-1]
-
     def test_500_clients_come_and_go_and_descriptors_and_memory_are_back(self):
         self.need_descriptors(2048)
 
@@ -216,7 +205,7 @@ class HostileClients(HelperTest):
                 client.close()
         crowd()
         eventually(lambda: self.daemon.descriptors() < 60, what="500 clients' descriptors going back")
-        before, memory = self.settled_descriptors(), self.daemon.resident_kib()
+        before, memory = self.daemon.settled_descriptors(), self.daemon.resident_kib()
         for _ in range(2):
             crowd()
         eventually(lambda: self.daemon.descriptors() <= before, what="the descriptors going back")

@@ -129,7 +129,7 @@ class EntitlementFiles(HelperTest):
     def test_refused_check_ins_leave_no_descriptor_behind(self):
         entitle("a.plist", SHA256="0" * 64)
         self.assertEqual(refused_with(), 35)
-        before = self.daemon.descriptors()
+        before = self.daemon.settled_descriptors()
         for _ in range(20):
             self.assertEqual(refused_with(), 35)
         self.assertEqual(as_account("stranger", refused_with), 35)
