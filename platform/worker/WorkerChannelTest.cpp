@@ -11,6 +11,7 @@
 #include <chrono>
 #include <cstring>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/base/fakes/LingeringSocket.h"
@@ -43,6 +44,13 @@ class WorkerChannelTest : public testing::Test {
   static int freeDescriptor() {
     const UniqueFd next(::dup(STDERR_FILENO));
     return next.get();
+  }
+  // What an earlier test leaves to be closed takes a moment, and all channels of a process share the room for
+  // it.
+  static void awaitRoomToDistrust() {
+    const auto end = Clock::now() + 30s;
+    while (!WorkerChannel::hasRoomToDistrust() && Clock::now() < end) std::this_thread::sleep_for(10ms);
+    ASSERT_TRUE(WorkerChannel::hasRoomToDistrust());
   }
 
   WorkerChannel one;
@@ -160,6 +168,7 @@ TEST_F(WorkerChannelTest, WithoutDescriptorsTheyAreALackOfThisProcess) {
 class DistrustedChannelTest : public WorkerChannelTest, public testing::WithParamInterface<int> {};
 
 TEST_P(DistrustedChannelTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
+  awaitRoomToDistrust();
   LingeringSocket lingering(2);
   other.distrust();
   WorkerMessage sent;
@@ -193,6 +202,7 @@ TEST_P(DistrustedChannelTest, ADescriptorWhoseCloseWaitsKeepsNobodyWaiting) {
 INSTANTIATE_TEST_SUITE_P(Ways, DistrustedChannelTest, testing::Values(0, 1, 2));
 
 TEST_F(WorkerChannelTest, AFloodOfDescriptorsWhoseCloseWaitsIsNotReceivedAnyMore) {
+  awaitRoomToDistrust();
   other.distrust();
   std::vector<LingeringSocket> waiting;
   for (int i = 0; i < 20; ++i) waiting.emplace_back(2);
