@@ -45,8 +45,7 @@ class WorkerChannelTest : public testing::Test {
     const UniqueFd next(::dup(STDERR_FILENO));
     return next.get();
   }
-  // What an earlier test leaves to be closed takes a moment, and all channels of a process share the room for
-  // it.
+  // All channels of a process share the room for what waits to be closed. An earlier test may have filled it.
   static void awaitRoomToDistrust() {
     const auto end = Clock::now() + 30s;
     while (!WorkerChannel::hasRoomToDistrust() && Clock::now() < end) std::this_thread::sleep_for(10ms);
