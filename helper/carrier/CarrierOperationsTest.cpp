@@ -237,6 +237,12 @@ TEST_F(CarrierOperationsTest, RemoveCarrierFileWithAnInvalidDomainFlushesNoDomai
   EXPECT_EQ(log.entries().front(), Log::bsdLine(SyslogPriority::notice, "Removing domain: a\xc3\n"));
 }
 
+TEST_F(CarrierOperationsTest, RemoveCarrierFileFlushesADomainOfOneLetter) {
+  const std::string file = home.file("Library/Carrier Bundles/file", "x");
+  EXPECT_EQ(operations.removeCarrierFile(kPort, Long(file).data(), Long("a").data()), 0);
+  EXPECT_EQ(preferences.flushed, (std::vector<std::optional<std::string>>{"a"}));
+}
+
 TEST_F(CarrierOperationsTest, RemoveCarrierFileReturns5ForWhatIsMissingOrAFullDirectory) {
   home.file("Library/Carrier Bundles/full/file", "kept");
   const std::string empty = home.directory("Library/Carrier Bundles/empty");
@@ -495,6 +501,14 @@ TEST_F(CarrierOperationsTest, CopyCrashLogsTakesAHomeThatEndsInASlash) {
   EXPECT_EQ(log.entries(),
             (std::vector{Log::bsdLine(SyslogPriority::notice, "'" + source + "', '" + home.path() +
                                                                   "/Library/Logs/CrashReporter/'\n")}));
+}
+
+TEST_F(CarrierOperationsTest, CopyCrashLogsTakesAHomeOfOneLetter) {
+  account.home = "/";
+  const std::string source = elsewhere / "missing";
+  EXPECT_EQ(operations.copyCrashLogs(kPort, Short(source).data(), &success), 0);
+  EXPECT_EQ(log.entries().front(),
+            Log::bsdLine(SyslogPriority::notice, "'" + source + "', '/Library/Logs/CrashReporter/'\n"));
 }
 
 TEST_F(CarrierOperationsTest, CopyCrashLogsThatFailsSaysWhyAtNoticeLevel) {
