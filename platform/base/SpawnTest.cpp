@@ -50,6 +50,12 @@ TEST(SpawnTest, AChildHasNoDescriptorOfOursButTheStandardOnes) {
   EXPECT_EQ(outputOf("if [ -e /proc/self/fd/" + number + " ]; then echo there; fi"), "");
 }
 
+TEST(SpawnTest, WhatAChildWritesWhereItWasGivenNothingIsWrittenNowhere) {
+  EXPECT_EQ(outputOf("readlink /proc/self/fd/2; echo lost >&2 && echo written",
+                     [](Spawn& spawn) { spawn.giveNothing(STDERR_FILENO); }),
+            "/dev/null\nwritten\n");
+}
+
 TEST(SpawnTest, SignalsThatWeIgnoreOrBlockEndTheChildAllTheSame) {
   const auto before = std::signal(SIGTERM, SIG_IGN);
   sigset_t blocked;

@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <set>
 #include <string>
 
 namespace brenvik {
@@ -22,6 +23,33 @@ TEST(Utf8Test, RefusesOverlongFormsSurrogatesAndCodePointsBeyondUnicode) {
                            "\xF0\x8F\xBF\xBF", "\xF4\x90\x80\x80", "\xF5\x80\x80\x80", "\xFF", "\x80"}) {
     EXPECT_FALSE(isValidUtf8(text));
     EXPECT_FALSE(isValidUtf8(std::string("12345678") + text + "abc"));
+  }
+}
+
+// By RFC 3629, section 3.
+std::string encoded(unsigned point) {
+  const auto tail = [](unsigned bits) { return static_cast<char>(0x80 | (bits & 0x3F)); };
+  if (point < 0x80) return {static_cast<char>(point)};
+  if (point < 0x800) return {static_cast<char>(0xC0 | point >> 6), tail(point)};
+  if (point < 0x10000) return {static_cast<char>(0xE0 | point >> 12), tail(point >> 6), tail(point)};
+  return {static_cast<char>(0xF0 | point >> 18), tail(point >> 12), tail(point >> 6), tail(point)};
+}
+
+TEST(Utf8Test, EveryCodePointAndNoOtherBeginningIsACharacter) {
+  std::set<std::string> beginnings;  // of two bytes
+  for (unsigned point = 0x80; point <= 0x10FFFF; ++point) {
+    if (point >= 0xD800 && point <= 0xDFFF) continue;  // surrogates
+    const std::string character = encoded(point);
+    ASSERT_EQ(utf8CharacterLength(character), character.size()) << point;
+    if ((point & 0x3F) == 0) beginnings.insert(character.substr(0, 2));
+  }
+  for (unsigned lead = 0x80; lead <= 0xFF; ++lead) {
+    for (unsigned second = 0; second <= 0xFF; ++second) {
+      const std::string beginning{static_cast<char>(lead), static_cast<char>(second)};
+      const bool isOne =
+          lead < 0xE0 ? second >= 0x80 && second <= 0xBF && lead >= 0xC2 : beginnings.contains(beginning);
+      EXPECT_EQ(utf8CharacterLength(beginning + "\x80\x80") != 0, isOne) << lead << ' ' << second;
+    }
   }
 }
 

@@ -66,6 +66,13 @@ TEST(LoaderCacheTest, LyingCountsAndOffsetsAreNotFollowed) {
   EXPECT_TRUE(asked(far, "libbaseband.so.0"));
 }
 
+TEST(LoaderCacheTest, ANameThatBeginsAtTheEndIsNoReasonToSayNo) {
+  std::string cache = cacheOf({"libz.so.1"}, 1) + "libbaseband.so.0";
+  const auto end = static_cast<std::uint32_t>(cache.size());
+  std::memcpy(cache.data() + 48 + 4, &end, sizeof end);
+  EXPECT_TRUE(asked(cache, "libbaseband.so.0"));
+}
+
 TEST(LoaderCacheTest, ThisSystemsOwnCacheIsUnderstood) {
   std::ifstream file("/etc/ld.so.cache", std::ios::binary);
   if (!file) GTEST_SKIP() << "this system has none";
