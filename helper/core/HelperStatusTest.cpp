@@ -5,11 +5,15 @@
 #include <gtest/gtest.h>
 
 #include <unistd.h>
+
+#include <cerrno>
 #include <future>
 #include <memory>
 
+#include "helper/heartbeat/EchoMessage.h"
 #include "platform/ipc/fakes/FakePorts.h"
 #include "platform/log/fakes/RecordingLog.h"
+#include "platform/net/fakes/FakeEchoNetwork.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
 
 namespace brenvik {
@@ -131,6 +135,22 @@ TEST_F(HelperStatusTest, HowLocationRequestsEndedIsToldWithoutAnyPlace) {
     clock.advance(2s);
     EXPECT_EQ(status.report().locationAnswer, (StatusReport::Event{name, 2000ms}));
   }
+}
+
+TEST_F(HelperStatusTest, WhatTheHeartbeatSentAndReceivedIsTold) {
+  ManualWorkQueues queues{clock};
+  FakeEchoNetwork network;
+  heartbeat.configure({queues, network, "203.0.113.9"});
+  const EchoMessage request = makeEchoRequest(static_cast<std::uint16_t>(::getpid() & 0xFFFF), timeval{});
+  std::vector<std::byte> reply(request.begin(), request.end());
+  reply[0] = std::byte{0};
+  network.arrivals.push_back({30ms, reply, 0});
+  EXPECT_EQ(heartbeat.ping(), 0);
+  EXPECT_EQ(heartbeat.ping(), ETIMEDOUT);
+  const StatusReport told = status.report();
+  EXPECT_EQ(told.heartbeatSent, (StatusReport::Traffic{2, 2 * request.size()}));
+  EXPECT_EQ(told.heartbeatReceived, (StatusReport::Traffic{1, request.size()}));
+  heartbeat.shutDown();
 }
 
 TEST_F(HelperStatusTest, WorkersAreToldAsTheyAre) {
