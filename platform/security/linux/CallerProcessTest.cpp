@@ -145,6 +145,11 @@ TEST_F(MadeUpProcessFolderTest, AProcessThatIsBeingRemovedIsThereNoLonger) {
   }
 }
 
+TEST_F(MadeUpProcessFolderTest, TheFirstProcessIsOneLikeAnyOther) {
+  std::filesystem::rename(proc / "7", proc / "1");
+  EXPECT_TRUE(CallerProcess::pin(proc.string(), 1, 100));
+}
+
 TEST_F(MadeUpProcessFolderTest, FactsThatAreEmptyOrCutShortOrNoneAreNobodys) {
   for (const char* const text : {"", "7 (caller) S 1 7", "nonsense"}) {
     write("stat", text);
