@@ -1112,6 +1112,17 @@ TEST_F(MadeUpProcessTest, ACallerThatBecomesAnotherProgramWhileItIsExplainedIsTo
   EXPECT_EQ(files.explainNoTask(token), "the caller cannot be examined now") << "there is nothing in its way";
 }
 
+TEST_F(MadeUpProcessTest, ACallerWhoseExecutableCannotBeToldIsExplainedAsOneThatHasEndedAndHoldsNothing) {
+  grant("etc/a.plist");
+  fs::remove(root / "proc/7/exe");
+  auto files = makeFiles((root / "proc").string());
+  const auto task = files.makeTask(token);
+  ASSERT_NE(task, nullptr);
+  EXPECT_FALSE(task->copyEntitlement(kName).value);
+  EXPECT_FALSE(task->copyEntitlement(kName).error);
+  EXPECT_EQ(task->explainRefusal(kName), "the caller has ended, or has become another program");
+}
+
 TEST_F(ExplanationTest, WhatCannotBeReadNowIsTheReason) {
   const auto file = grant("etc/a.plist");
   const Child caller(program);

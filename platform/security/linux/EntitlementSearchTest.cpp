@@ -23,17 +23,17 @@
 namespace brenvik {
 namespace {
 
-// While it lives, fstat(2) on this thread gives what `change` makes of the facts.
+// While it lives, fstat(2) on this thread gives what `change` makes of the facts of a descriptor's file.
 class ChangedFacts {
  public:
-  using Change = std::function<void(struct stat* facts)>;
+  using Change = std::function<void(int fd, struct stat* facts)>;
   explicit ChangedFacts(Change change) : change_(std::move(change)) { current_ = this; }
   ~ChangedFacts() { current_ = nullptr; }
   ChangedFacts(const ChangedFacts&) = delete;
   ChangedFacts& operator=(const ChangedFacts&) = delete;
 
-  static void apply(struct stat* facts) {
-    if (current_ != nullptr) current_->change_(facts);
+  static void apply(int fd, struct stat* facts) {
+    if (current_ != nullptr) current_->change_(fd, facts);
   }
 
  private:
@@ -49,7 +49,7 @@ int changedFstat(int fd, struct stat* facts) noexcept __asm__("fstat");
 
 int changedFstat(int fd, struct stat* facts) noexcept {
   const auto result = static_cast<int>(::syscall(SYS_newfstatat, fd, "", facts, AT_EMPTY_PATH));
-  if (result == 0) brenvik::ChangedFacts::apply(facts);
+  if (result == 0) brenvik::ChangedFacts::apply(fd, facts);
   return result;
 }
 }
@@ -348,6 +348,31 @@ TEST_F(EntitlementSearchTest, AFileThatWasNoRegularOneWhenItWasOpenedIsPassedOve
   expectOneError(passedOver("etc/a.plist", "not a regular file"));
 }
 
+TEST_F(EntitlementSearchTest, NoProgramThatIsStartedMeanwhileGetsADescriptor) {
+  grant("etc/a.plist", "<true/>", quoted("Unit", "caller.service") + quoted("SHA256", digestOfProgram()));
+  const auto inherited = [] {
+    int count = 0;
+    for (int fd = 0; fd < 1024; ++fd) {
+      const int flags = ::fcntl(fd, F_GETFD);
+      if (flags >= 0 && (flags & FD_CLOEXEC) == 0) ++count;
+    }
+    return count;
+  };
+  const int before = inherited();
+  int looks = 0;
+  candidate.whenAskedForUnit = [&] {  // the directory is open
+    ++looks;
+    EXPECT_EQ(inherited(), before);
+  };
+  const ChangedFacts atEachFile([&](int fd, struct stat*) {
+    ++looks;
+    EXPECT_EQ(::fcntl(fd, F_GETFD), FD_CLOEXEC);
+  });
+  (void)findingsInEtc();
+  EXPECT_TRUE(result.value);
+  EXPECT_EQ(looks, 3) << "the file, the directory, the executable";
+}
+
 // ----- What is told once -----
 
 TEST_F(EntitlementSearchTest, AFaultIsToldAgainWhenAnyOfTheFilesFactsHasChanged) {
@@ -360,13 +385,13 @@ TEST_F(EntitlementSearchTest, AFaultIsToldAgainWhenAnyOfTheFilesFactsHasChanged)
   ask();
   EXPECT_THAT(log.entries(), IsEmpty());
   const std::vector<ChangedFacts::Change> changes{
-      [](struct stat* facts) { ++facts->st_dev; },
-      [](struct stat* facts) { ++facts->st_ino; },
-      [](struct stat* facts) { ++facts->st_size; },
-      [](struct stat* facts) { ++facts->st_mtim.tv_sec; },
-      [](struct stat* facts) { ++facts->st_mtim.tv_nsec; },
-      [](struct stat* facts) { ++facts->st_ctim.tv_sec; },
-      [](struct stat* facts) { ++facts->st_ctim.tv_nsec; },
+      [](int, struct stat* facts) { ++facts->st_dev; },
+      [](int, struct stat* facts) { ++facts->st_ino; },
+      [](int, struct stat* facts) { ++facts->st_size; },
+      [](int, struct stat* facts) { ++facts->st_mtim.tv_sec; },
+      [](int, struct stat* facts) { ++facts->st_mtim.tv_nsec; },
+      [](int, struct stat* facts) { ++facts->st_ctim.tv_sec; },
+      [](int, struct stat* facts) { ++facts->st_ctim.tv_nsec; },
   };
   for (const auto& change : changes) {
     {
