@@ -206,6 +206,13 @@ TEST_F(MadeUpProcessFolderTest, TheReaderIsAskedWhenEitherOfTheTwoFactsMayNotBeR
   ASSERT_EQ(::chmod((proc / "closed").c_str(), 0700), 0);  // so that it can be removed
 }
 
+TEST_F(MadeUpProcessFolderTest, ThePathOfTheExecutableIsWhatTheKernelSaysHoweverShort) {
+  std::filesystem::create_symlink("x", proc / "7/exe");
+  const auto process = CallerProcess::pin(proc.string(), 7, 100);
+  ASSERT_TRUE(process);
+  EXPECT_EQ(process->facts().executablePath, "x");
+}
+
 TEST_F(MadeUpProcessFolderTest, NoProgramThatIsStartedMeanwhileGetsAProcesssFolder) {
   const auto inherited = [] {
     int count = 0;

@@ -348,6 +348,48 @@ TEST_F(EntitlementSearchTest, AFileThatWasNoRegularOneWhenItWasOpenedIsPassedOve
   expectOneError(passedOver("etc/a.plist", "not a regular file"));
 }
 
+TEST_F(EntitlementSearchTest, ADirectoryThatMayNotBeLookedAtEndsTheSearch) {
+  grant("lib/a.plist");
+  EntitlementSearch search(accounts, {(root / "etc").string(), (root / "lib").string()});
+  const FailingCall failing("lstat", EACCES);
+  const auto found = search.find(kName, candidate);
+  EXPECT_TRUE(found.error);
+  EXPECT_FALSE(found.value);
+  expectOneError(line("entitlements cannot be told: ", root / "etc", " cannot be examined"));
+}
+
+TEST_F(EntitlementSearchTest, AFileThatGetsShorterWhileItIsReadEndsTheSearch) {
+  const auto file = grant("etc/a.plist");
+  grant("etc/b.plist");
+  EntitlementSearch search(accounts, {(root / "etc").string()});
+  const ChangedFacts changed([](int, struct stat* facts) { ++facts->st_size; });
+  const auto found = search.find(kName, candidate);
+  EXPECT_TRUE(found.error);
+  EXPECT_FALSE(found.value);
+  expectOneError(line("entitlements cannot be told: ", file, " cannot be examined"));
+}
+
+TEST_F(EntitlementSearchTest, TheFileThatWasLookedAtIsDigestedWhereverALinkToItLeadsSince) {
+  const fs::path link = root / "link";
+  fs::create_symlink(program, link);
+  write("etc/a.plist", document(quoted("Executable", link.string()) + quoted("Unit", "caller.service") +
+                                quoted("SHA256", digestOfProgram()) + held()));
+  candidate.whenAskedForUnit = [&] {
+    fs::remove(link);
+    fs::create_symlink("/bin/sh", link);
+  };
+  EXPECT_EQ(findingsInEtc().back(), "etc/a.plist: holds SHA256 is the digest of the executable");
+  EXPECT_TRUE(result.value);
+}
+
+TEST_F(EntitlementSearchTest, AnExecutableThatCannotBeReliedOnIsNamedWithoutLinks) {
+  fs::create_symlink(program, root / "link");
+  ASSERT_EQ(::chmod(program.c_str(), 0777), 0);
+  write("etc/a.plist", document(quoted("Executable", (root / "link").string()) + held()));
+  EXPECT_EQ(findingsInEtc().at(1), "etc/a.plist: wrong Executable cannot be relied on: " + program +
+                                       " is not owned by root, or others may write to it");
+}
+
 TEST_F(EntitlementSearchTest, NoProgramThatIsStartedMeanwhileGetsADescriptor) {
   grant("etc/a.plist", "<true/>", quoted("Unit", "caller.service") + quoted("SHA256", digestOfProgram()));
   const auto inherited = [] {
@@ -406,6 +448,36 @@ TEST_F(EntitlementSearchTest, AFaultIsToldAgainWhenAnyOfTheFilesFactsHasChanged)
   }
 }
 
+TEST_F(EntitlementSearchTest, AFaultOfALinkOrDirectoryIsToldAgainForAnotherOneInItsPlace) {
+  const fs::path etc = root / "etc";
+  EntitlementSearch search(accounts, {etc.string()});
+  const auto lines = [&] {
+    EXPECT_FALSE(search.find(kName, candidate).value);
+    const std::size_t count = log.entries().size();
+    log.clear();
+    return count;
+  };
+  fs::create_symlink(program, etc / "a.plist");
+  EXPECT_EQ(lines(), 1U);
+  EXPECT_EQ(lines(), 0U);
+  fs::create_symlink(program, etc / "another");
+  fs::rename(etc / "another", etc / "a.plist");
+  EXPECT_EQ(lines(), 1U);
+  fs::remove(etc / "a.plist");
+
+  ASSERT_EQ(::chmod(etc.c_str(), 0777), 0);
+  EXPECT_EQ(lines(), 1U);
+  EXPECT_EQ(lines(), 0U);
+  fs::rename(etc, root / "before");
+  fs::create_directory(etc);
+  ASSERT_EQ(::chmod(etc.c_str(), 0777), 0);
+  EXPECT_EQ(lines(), 1U) << "another directory";
+  ASSERT_EQ(::chmod(etc.c_str(), 0755), 0);
+  EXPECT_EQ(lines(), 0U);
+  ASSERT_EQ(::chmod(etc.c_str(), 0777), 0);
+  EXPECT_EQ(lines(), 1U) << "it was in order meanwhile";
+}
+
 TEST_F(EntitlementSearchTest, AnotherFaultOfTheSameFileIsTold) {
   const auto file = grant("etc/a.plist", "<true/>", quoted("User", "keeper"));
   EntitlementSearch search(accounts, {(root / "etc").string()});
@@ -435,6 +507,24 @@ TEST_F(EntitlementSearchTest, OfManyFaultsAThousandAndTwentyFourAreRememberedAsT
   EXPECT_EQ(toldAgain(), 0U);
   directories.push_back(program + "/1024");
   EXPECT_EQ(toldAgain(), directories.size()) << "what is kept does not grow any further";
+}
+
+TEST_F(EntitlementSearchTest, ANewFaultOfAFileThatHadOneLeavesTheOthersToldWhereNoMoreAreRemembered) {
+  std::vector<std::string> directories;
+  for (int i = 0; i < 1023; ++i) directories.push_back(program + '/' + std::to_string(i));
+  directories.push_back((root / "etc").string());
+  ASSERT_EQ(::chmod(grant("etc/a.plist").c_str(), 0666), 0);
+  EntitlementSearch search(accounts, directories);
+  const auto lines = [&] {
+    EXPECT_FALSE(search.find(kName, candidate).value);
+    const std::size_t count = log.entries().size();
+    log.clear();
+    return count;
+  };
+  EXPECT_EQ(lines(), 1024U);
+  ASSERT_EQ(::chmod(grant("etc/a.plist", "<false/>").c_str(), 0666), 0);  // of another size
+  EXPECT_EQ(lines(), 1U);
+  EXPECT_EQ(lines(), 0U);
 }
 
 TEST_F(EntitlementSearchTest, AFaultThatIsShownToSomebodyIsToldInTheLogAllTheSame) {
