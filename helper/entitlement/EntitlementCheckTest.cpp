@@ -9,7 +9,9 @@
 #include <array>
 #include <atomic>
 #include <barrier>
+#include <chrono>
 #include <csignal>
+#include <functional>
 #include <future>
 #include <map>
 #include <mutex>
@@ -349,6 +351,48 @@ TEST_F(EntitlementCheckTest, TheTeardownEndsEveryWatcherAndForgetsEveryGrant) {
   EXPECT_EQ(queues.watchersOf(7), 0U);
 }
 
+// A watcher whose activation comes late. Nothing else is used.
+class LateActivation final : public WorkQueues {
+ public:
+  WorkQueue& main() noexcept override { std::abort(); }
+  WorkQueue& global() noexcept override { std::abort(); }
+  std::shared_ptr<WorkQueue> makeSerial(std::string, QualityOfService) override { std::abort(); }
+  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t, std::uint32_t, WorkQueue::Task,
+                                                           WorkQueue::Task) override {
+    return std::make_unique<Source>(*this);
+  }
+
+  std::function<void()> beforeActivation;
+  int activations = 0;
+  int activationsInVain = 0;  // of a watcher that was cancelled before
+
+ private:
+  class Source final : public ProcessExitSource {
+   public:
+    explicit Source(LateActivation& owner) : owner_(owner) {}
+    void activate() override {
+      if (owner_.beforeActivation) owner_.beforeActivation();
+      ++owner_.activations;
+      if (isCancelled_) ++owner_.activationsInVain;
+    }
+    void cancel() noexcept override { isCancelled_ = true; }
+
+   private:
+    LateActivation& owner_;
+    bool isCancelled_ = false;
+  };
+};
+
+TEST_F(EntitlementCheckTest, AWatcherThatIsActivatedAfterTheTeardownWasCancelledByIt) {
+  LateActivation late;
+  EntitlementCheck asked(security, late);
+  security.grant(caller, kName, PropertyList::boolean(true));
+  late.beforeActivation = [&] { asked.tearDown(); };
+  EXPECT_TRUE(asked.HasEntitlement(kName, caller));
+  EXPECT_EQ(late.activations, 1);
+  EXPECT_EQ(late.activationsInVain, 1);
+}
+
 TEST_F(EntitlementCheckTest, AnExitHandledAfterTheTeardownFindsNothingToDo) {
   security.grant(caller, kName, PropertyList::boolean(true));
   EXPECT_TRUE(check.HasEntitlement(kName, caller));
@@ -405,6 +449,26 @@ TEST_F(EntitlementCheckTest, RefusalsThatHadNoLineAreToldAtTheTeardown) {
   ASSERT_EQ(log.entries().size(), 2U);
   EXPECT_EQ(log.entries()[1].line,
             "refused 2 more check-ins of account 501, executable /usr/libexec/program");
+}
+
+TEST_F(EntitlementCheckTest, RefusalsThatHadNoLineAreToldWhenTheCheckEnds) {
+  RecordingLog log;
+  security.addProcess(caller);
+  {
+    EntitlementCheck shortLived(security, queues);
+    for (int i = 0; i < 2; ++i) EXPECT_FALSE(shortLived.HasEntitlement(kName, caller));
+    EXPECT_EQ(log.entries().size(), 1U);
+  }
+  ASSERT_EQ(log.entries().size(), 2U);
+  EXPECT_EQ(log.entries()[1].line,
+            "refused 1 more check-ins of account 501, executable /usr/libexec/program");
+}
+
+TEST_F(EntitlementCheckTest, TheClockOfRefusalsIsTheSystemsThatIsNeverSet) {
+  const auto before = std::chrono::steady_clock::now().time_since_epoch();
+  const auto told = EntitlementCheck::steadyTime();
+  EXPECT_GE(told, before);
+  EXPECT_LE(told, std::chrono::steady_clock::now().time_since_epoch());
 }
 
 TEST_F(EntitlementCheckTest, AGrantedCallerIsDescribedUntilItsProcessExitsAndNobodyElseIs) {

@@ -76,6 +76,17 @@ TEST_F(RefusalLogTest, FurtherRefusalsOfTheSameProgramAreCountedAndToldAMinuteLa
   EXPECT_THAT(log.entries(), ElementsAre(refusalOf(8))) << "none was left untold";
 }
 
+TEST_F(RefusalLogTest, OneRefusalThatWasNotToldIsToldAMinuteLater) {
+  refuse(caller);
+  refuse(caller);
+  log.clear();
+  now += seconds(60);
+  refuse(caller);
+  EXPECT_THAT(log.entries(),
+              ElementsAre(line("refused 1 more check-ins of account 501, executable /usr/bin/program"),
+                          refusalOf(7)));
+}
+
 TEST_F(RefusalLogTest, AnotherAccountOrExecutableIsAnotherCaller) {
   refuse(caller);
   refuse({7, 502, caller.executable, ""});
@@ -91,6 +102,23 @@ TEST_F(RefusalLogTest, AtTheEndTheNumbersThatWereNotToldAre) {
   refusals.flush();
   EXPECT_THAT(log.entries(),
               ElementsAre(line("refused 1 more check-ins of account 501, executable /usr/bin/program")));
+}
+
+TEST_F(RefusalLogTest, AtTheEndOnlyNumbersThatWereNotToldAreAndEverybodyIsForgotten) {
+  const auto refuseAsManyAsAreRememberedAndOneMore = [&] {
+    for (std::size_t i = 0; i <= RefusalLog::kMaxCallers; ++i) {
+      refuse({7, static_cast<uid_t>(i), "/x", ""});
+    }
+    EXPECT_EQ(log.entries().size(), RefusalLog::kMaxCallers + 1) << "each is told, the further one, too";
+    log.clear();
+  };
+  refuseAsManyAsAreRememberedAndOneMore();
+  refusals.flush();
+  EXPECT_THAT(log.entries(), IsEmpty());
+  refuseAsManyAsAreRememberedAndOneMore();
+  refuse({7, 9999, "/x", ""});
+  refusals.flush();
+  EXPECT_THAT(log.entries(), ElementsAre(line("refused 1 more check-ins of further callers")));
 }
 
 TEST_F(RefusalLogTest, ManyCallersAreRememberedOnlyUpToALimitAndTheOthersCountAsOne) {

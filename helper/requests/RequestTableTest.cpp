@@ -22,6 +22,23 @@ namespace {
 
 constexpr PortName kPort = 0x903;
 
+// Areas of a table that tells when it is read behind its end.
+struct CheckedAreas {};
+struct CheckedHandlers {
+  static std::size_t size() noexcept { return kRequestRoutines.size(); }
+  RoutineTable::Handler operator[](std::size_t index) const {
+    EXPECT_LT(index, size());
+    return [](void*, const Request&, Reply&) { return Outcome::refused; };
+  }
+};
+
+}  // namespace
+
+template <>
+inline constexpr CheckedHandlers kRowHandlers<CheckedAreas>{};
+
+namespace {
+
 class RequestTableTest : public testing::Test {
  protected:
   // A request of the row's own form, with each string field filled with its own letter to the last byte.
@@ -128,6 +145,15 @@ TEST_F(RequestTableTest, IdsOutsideTheRangeHaveNoHandler) {
   EXPECT_EQ(table.find(0), nullptr);
   EXPECT_EQ(table.find(-1), nullptr);
   EXPECT_EQ(table.find(INT32_MIN), nullptr);
+}
+
+TEST_F(RequestTableTest, TheRowsAreNotReadBehindTheirEnd) {
+  CheckedAreas checked;
+  const RequestTable<CheckedAreas> rows([&] { return &checked; });
+  EXPECT_EQ(rows.find(8683548), nullptr);
+  EXPECT_NE(rows.find(8683549), nullptr);
+  EXPECT_NE(rows.find(8683575), nullptr);
+  EXPECT_EQ(rows.find(8683576), nullptr);
 }
 
 TEST_F(RequestTableTest, ARequestOneByteLongerOrShorterThanItsRowGetsMinus304AndHasNoEffect) {
@@ -241,6 +267,37 @@ TEST_F(RequestTableTest, TheUpdateChecksReplyLeavesTheNdrRecordToTheSourceOnSucc
     ASSERT_EQ(deliver(other), kern::success);
     const std::size_t at = other.reply == ReplyForm::outOfLine ? 44 : 24;
     EXPECT_EQ(std::memcmp(answer + at, &kNdrRecord, sizeof kNdrRecord), 0) << other.name;
+  }
+}
+
+TEST_F(RequestTableTest, AReplyIsCompletedWhateverStoodInItsFixedFieldsAndItsResultIsLeftAlone) {
+  for (const ReplyForm form : {ReplyForm::status, ReplyForm::integer, ReplyForm::string64,
+                               ReplyForm::string256, ReplyForm::outOfLine}) {
+    for (const ReplyNdr ndr : {ReplyNdr::ours, ReplyNdr::ofTheSource}) {
+      std::memset(answer, 0xEE, sizeof answer);
+      Reply reply(answer);
+      buildReply(form, ndr, reply);
+      EXPECT_EQ(reply.header().size, sizeOfReply(form));
+      if (form == ReplyForm::outOfLine) {
+        const auto& full = reply.as<OutOfLineReply>();
+        EXPECT_EQ(full.header.bits, kComplexBit | kReplyDisposition);
+        EXPECT_EQ(full.descriptorCount, 1U);
+        EXPECT_EQ(std::uint64_t{full.payload.address}, 0xEEEEEEEEEEEEEEEEU);
+        EXPECT_EQ(full.payload.size, 0xEEEEEEEEU);
+        EXPECT_EQ(full.payload.deallocate, 1);
+        EXPECT_EQ(full.payload.copy, 1);
+        EXPECT_EQ(full.payload.type, 1);
+        EXPECT_EQ(full.byteCount, 0xEEEEEEEEU);
+        continue;
+      }
+      const auto& full = reply.as<StatusReply>();
+      EXPECT_EQ(full.header.bits, kReplyDisposition);
+      EXPECT_EQ(full.returnCode, kern::success);
+      EXPECT_EQ(std::memcmp(&full.ndr, &kNdrRecord, sizeof kNdrRecord) == 0, ndr == ReplyNdr::ours);
+      for (std::size_t i = sizeof(StatusReply); i < sizeof answer; ++i) {
+        ASSERT_EQ(answer[i], std::byte{0xEE}) << i;
+      }
+    }
   }
 }
 

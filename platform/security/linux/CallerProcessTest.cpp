@@ -2,6 +2,7 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/security/linux/CallerProcess.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -11,8 +12,10 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <string>
 
 #include "platform/base/ProcessFacts.h"
+#include "platform/security/linux/CallerTestSupport.h"
 
 namespace brenvik {
 namespace {
@@ -36,9 +39,11 @@ TEST(UnitOfCgroupsTest, WithoutAUnifiedLineTheOneNamedSystemdCounts) {
 
 TEST(UnitOfCgroupsTest, OtherHierarchiesAndOtherTextsGiveNone) {
   EXPECT_EQ(unitOfCgroups(""), "");
-  EXPECT_EQ(unitOfCgroups("2:cpu:/x/wrong.service\n"), "");
-  EXPECT_EQ(unitOfCgroups("12::/x/wrong.service\n"), "");
-  EXPECT_EQ(unitOfCgroups("0:cpu:/x/wrong.service\n"), "");
+  EXPECT_EQ(unitOfCgroups("2:cpu:/x.slice/wrong.service\n"), "");
+  EXPECT_EQ(unitOfCgroups("12::/x.slice/wrong.service\n"), "");
+  EXPECT_EQ(unitOfCgroups("0:cpu:/x.slice/wrong.service\n"), "");
+  EXPECT_EQ(unitOfCgroups("1:name=systemd2:/x.slice/wrong.service\n"), "");
+  EXPECT_EQ(unitOfCgroups("1:cpu,name=systemd:/x.slice/wrong.service\n"), "");
   EXPECT_EQ(unitOfCgroups("0::no-slash\n"), "");
   EXPECT_EQ(unitOfCgroups("::\n:\n0\n"), "");
 }
@@ -145,6 +150,11 @@ TEST_F(MadeUpProcessFolderTest, AProcessThatIsBeingRemovedIsThereNoLonger) {
   }
 }
 
+TEST_F(MadeUpProcessFolderTest, TheFirstProcessIsOneLikeAnyOther) {
+  std::filesystem::rename(proc / "7", proc / "1");
+  EXPECT_TRUE(CallerProcess::pin(proc.string(), 1, 100));
+}
+
 TEST_F(MadeUpProcessFolderTest, FactsThatAreEmptyOrCutShortOrNoneAreNobodys) {
   for (const char* const text : {"", "7 (caller) S 1 7", "nonsense"}) {
     write("stat", text);
@@ -161,10 +171,61 @@ TEST_F(MadeUpProcessFolderTest, AListOfGroupsThatCannotBeReadOrNeverEndsGivesNoU
   EXPECT_EQ(process->unit(), "") << "no file";
   write("cgroup", line);
   EXPECT_EQ(process->unit(), "caller.service");
-  write("cgroup", std::string(60 << 10, '\n') + line);
+  constexpr std::size_t kLargest = 64 << 10;
+  write("cgroup", std::string(kLargest - line.size(), '\n') + line);
   EXPECT_EQ(process->unit(), "caller.service") << "long, but no longer than it may be";
-  write("cgroup", std::string(70 << 10, '\n') + line);
+  write("cgroup", std::string(kLargest - line.size() + 1, '\n') + line);
   EXPECT_EQ(process->unit(), "");
+}
+
+TEST_F(MadeUpProcessFolderTest, TheReaderIsAskedWhenEitherOfTheTwoFactsMayNotBeRead) {
+  std::filesystem::create_directories(proc / "7/ns");
+  std::filesystem::create_directory(proc / "closed");
+  ASSERT_EQ(::chmod((proc / "closed").c_str(), 0), 0);
+  const auto asked = [&](const char* executable, const char* userNamespace) {
+    std::filesystem::remove(proc / "7/exe");
+    std::filesystem::remove(proc / "7/ns/user");
+    std::filesystem::create_symlink(proc / executable, proc / "7/exe");
+    std::filesystem::create_symlink(proc / userNamespace, proc / "7/ns/user");
+    return withoutCapabilities([&] {
+      AnsweringReader reader;
+      const auto process = CallerProcess::pin(proc.string(), 7, 100, &reader);
+      if (!process) return 90;
+      const CallerFacts facts = process->facts();
+      if (!facts.executable || !facts.userNamespace) return 91;
+      const bool isTheReaders = facts.executable == someFacts().executable &&
+                                facts.userNamespace == someFacts().userNamespace &&
+                                facts.executablePath == someFacts().executablePath;
+      return isTheReaders == (reader.asked > 0) ? reader.asked : 92;
+    });
+  };
+  EXPECT_EQ(asked("7/stat", "7/stat"), 0);
+  EXPECT_EQ(asked("closed/x", "7/stat"), 1);
+  EXPECT_EQ(asked("7/stat", "closed/x"), 1);
+  EXPECT_EQ(asked("closed/x", "closed/x"), 1);
+  ASSERT_EQ(::chmod((proc / "closed").c_str(), 0700), 0);  // so that it can be removed
+}
+
+TEST_F(MadeUpProcessFolderTest, ThePathOfTheExecutableIsWhatTheKernelSaysHoweverShort) {
+  std::filesystem::create_symlink("x", proc / "7/exe");
+  const auto process = CallerProcess::pin(proc.string(), 7, 100);
+  ASSERT_TRUE(process);
+  EXPECT_EQ(process->facts().executablePath, "x");
+}
+
+TEST_F(MadeUpProcessFolderTest, NoProgramThatIsStartedMeanwhileGetsAProcesssFolder) {
+  const auto inherited = [] {
+    int count = 0;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+      const int flags = ::fcntl(std::stoi(entry.path().filename()), F_GETFD);
+      if (flags >= 0 && (flags & FD_CLOEXEC) == 0) ++count;
+    }
+    return count;
+  };
+  const int before = inherited();
+  const auto process = CallerProcess::pin(proc.string(), 7, 100);
+  ASSERT_TRUE(process);
+  EXPECT_EQ(inherited(), before);
 }
 
 }  // namespace

@@ -143,6 +143,7 @@ TEST_F(CallerReaderTest, AWorkerThatDiesOfAQuestionIsReplacedOnceAndTheNextQuest
   });
   RemoteCallerReader reader(worker);
   EXPECT_FALSE(ask(reader)) << "two died of it";
+  EXPECT_EQ(worker.opened(), 2) << "a question that kills workers is not tried on all of them";
   EXPECT_TRUE(ask(reader)) << "one more died, and its successor answers";
   EXPECT_EQ(worker.opened(), 4);
 }

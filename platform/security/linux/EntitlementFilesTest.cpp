@@ -19,10 +19,8 @@
 #include <csignal>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
 #include <thread>
 
-#include "platform/accounts/fakes/FakeAccountDirectory.h"
 #include "platform/base/ProcessFacts.h"
 #include "platform/base/UniqueFd.h"
 #include "platform/base/fakes/FailingAllocations.h"
@@ -31,6 +29,7 @@
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/plist/PropertyListCodec.h"
 #include "platform/security/linux/CallerTestSupport.h"
+#include "platform/security/linux/EntitlementTestSupport.h"
 #include "platform/security/linux/Sha256.h"
 
 // Calls of this program that a test may let fail. None of the opens here makes a file. Only the symbols have
@@ -73,25 +72,7 @@ namespace fs = std::filesystem;
 using testing::ElementsAre;
 using testing::IsEmpty;
 
-constexpr const char* kName = "com.example.allow";
 constexpr uid_t kStranger = 65534;
-
-std::string quoted(const std::string& key, const std::string& text) {
-  return "<key>" + key + "</key><string>" + text + "</string>";
-}
-std::string held(const std::string& value = "<true/>") {
-  return std::string("<key>Entitlements</key><dict><key>") + kName + "</key>" + value + "</dict>";
-}
-std::string document(const std::string& keys) {
-  return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>" + keys +
-         "</dict></plist>\n";
-}
-
-std::string hexOf(std::uint8_t byte) {
-  std::array<char, 3> two;
-  std::snprintf(two.data(), two.size(), "%02x", byte);
-  return two.data();
-}
 
 // A process that runs `program` as root until this object goes, or kill() is called.
 class Child {
@@ -137,36 +118,8 @@ class Child {
   std::uint32_t startTime_ = 0;
 };
 
-class EntitlementFilesTest : public testing::Test {
+class EntitlementFilesTest : public EntitlementFolderTest {
  protected:
-  void SetUp() override {
-    if (::geteuid() != 0) GTEST_SKIP() << "files owned by root are made by root";
-    std::string name = (fs::temp_directory_path() / "entitlements-XXXXXX").string();
-    root = ::mkdtemp(name.data());
-    // Umask and a link in the path of the temporary folder are not what is tested.
-    root = fs::canonical(root);
-    for (const char* const folder : {"etc", "lib"}) {
-      fs::create_directory(root / folder);
-      ASSERT_EQ(::chmod((root / folder).c_str(), 0755), 0);
-    }
-    program = (root / "program").string();
-    fs::copy_file("/bin/cat", program);
-    ASSERT_EQ(::chmod(program.c_str(), 0755), 0);
-  }
-  void TearDown() override {
-    if (!root.empty()) fs::remove_all(root);
-  }
-
-  fs::path write(const char* name, const std::string& content) {
-    const fs::path path = root / name;
-    std::ofstream(path, std::ios::binary) << content;
-    EXPECT_EQ(::chmod(path.c_str(), 0644), 0);
-    return path;
-  }
-  fs::path grant(const char* name, const std::string& value = "<true/>", const std::string& more = "") {
-    return write(name, document(quoted("Executable", program) + more + held(value)));
-  }
-
   EntitlementFiles makeFiles(const std::string& proc = "/proc") {
     return EntitlementFiles(accounts, {(root / "etc").string(), (root / "lib").string()}, proc);
   }
@@ -190,21 +143,6 @@ class EntitlementFilesTest : public testing::Test {
     EXPECT_EQ(answer.value, PropertyList::boolean(true)) << why;
     EXPECT_FALSE(answer.error) << why;
   }
-  std::string line(const char* before, const fs::path& path, const char* after) {
-    return before + path.string() + after;
-  }
-  std::string passedOver(const char* name, const std::string& why) {
-    return "entitlement file " + (root / name).string() + " passed over: " + why;
-  }
-  void expectOneError(const std::string& text) {
-    EXPECT_THAT(log.entries(), ElementsAre(RecordingLog::unifiedLine(LogLevel::error, text)));
-    log.clear();
-  }
-
-  fs::path root;
-  std::string program;
-  FakeAccountDirectory accounts;
-  RecordingLog log;
 };
 
 TEST_F(EntitlementFilesTest, ACallerThatOnlyTheReaderMayReadCostsTwoQuestions) {
@@ -1172,6 +1110,17 @@ TEST_F(MadeUpProcessTest, ACallerThatBecomesAnotherProgramWhileItIsExplainedIsTo
   };
   EXPECT_EQ(task->explainRefusal(kName), "the caller has ended, or has become another program");
   EXPECT_EQ(files.explainNoTask(token), "the caller cannot be examined now") << "there is nothing in its way";
+}
+
+TEST_F(MadeUpProcessTest, ACallerWhoseExecutableCannotBeToldIsExplainedAsOneThatHasEndedAndHoldsNothing) {
+  grant("etc/a.plist");
+  fs::remove(root / "proc/7/exe");
+  auto files = makeFiles((root / "proc").string());
+  const auto task = files.makeTask(token);
+  ASSERT_NE(task, nullptr);
+  EXPECT_FALSE(task->copyEntitlement(kName).value);
+  EXPECT_FALSE(task->copyEntitlement(kName).error);
+  EXPECT_EQ(task->explainRefusal(kName), "the caller has ended, or has become another program");
 }
 
 TEST_F(ExplanationTest, WhatCannotBeReadNowIsTheReason) {

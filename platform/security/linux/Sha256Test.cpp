@@ -6,11 +6,14 @@
 #include <gtest/gtest.h>
 #include <sys/mman.h>
 #include <sys/resource.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <string>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/base/fakes/FailingCalls.h"
 
 namespace brenvik {
 namespace {
@@ -34,6 +37,20 @@ TEST(Sha256Test, WhatCannotBeReadHasNoDigest) {
   EXPECT_FALSE(sha256OfFile(-1));
   const UniqueFd folder(::open("/", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   EXPECT_FALSE(sha256OfFile(folder.get()));
+}
+
+TEST(Sha256Test, AReadThatASignalInterruptedIsDoneAgainAndTheEndIsTheEndAllTheSame) {
+  // A datagram of no bytes reads as the end of a file, and whoever reads on finds nothing there.
+  int ends[2];
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0, ends), 0);
+  const UniqueFd from(ends[0]);
+  const UniqueFd to(ends[1]);
+  ASSERT_EQ(::send(to.get(), "abc", 3, 0), 3);
+  ASSERT_EQ(::send(to.get(), "", 0, 0), 0);
+  const FailingCall interrupted("read", EINTR);
+  const auto digest = sha256OfFile(from.get());
+  EXPECT_EQ(interrupted.failures(), 1);
+  EXPECT_EQ(digest, parseSha256("ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad"));
 }
 
 // Exits with 7 when a digest cannot be had without a descriptor to spare and can be had with one.
