@@ -4,6 +4,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <pwd.h>
 #include <sched.h>
 #include <sys/file.h>
 #include <sys/mount.h>
@@ -23,6 +24,8 @@
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/base/fakes/FailingAllocations.h"
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/plist/EditableDictionary.h"
 #include "platform/plist/PropertyListCodec.h"
@@ -43,6 +46,12 @@ std::string binary(const PropertyList& value) {
 
 PropertyList textDictionary(const std::string& key, const std::string& text) {
   return PropertyList::dictionary({{key, PropertyList::string(text)}});
+}
+
+// Sets a time that is long past, so that the file does not count as young.
+void makeOld(const fs::path& path, long nanoseconds = 0) {
+  const timespec old[2] = {{1'000'000, nanoseconds}, {1'000'000, nanoseconds}};
+  ASSERT_EQ(::utimensat(AT_FDCWD, path.c_str(), old, 0), 0);
 }
 
 mode_t modeOf(const fs::path& path) {
@@ -133,9 +142,41 @@ TEST_F(FilePreferencesTest, PlacesThatAreKnownAreAskedForOnceAndNotBeforeTheyAre
 
 TEST_F(FilePreferencesTest, TheSystemsPlacesAreTheEffectiveUsersHomeAndTheMachinesId) {
   const auto places = FilePreferences::systemPlaces();
-  EXPECT_TRUE(places.home.starts_with("/"));
+  const passwd* const account = ::getpwuid(::geteuid());
+  ASSERT_NE(account, nullptr);
+  EXPECT_EQ(places.home, account->pw_dir);
   EXPECT_TRUE(places.anyUser.starts_with("/"));
   EXPECT_TRUE(places.machineId.empty() || places.machineId.size() == 32);
+}
+
+TEST_F(FilePreferencesTest, AMachineIdIs32LowerCaseHexadecimalDigitsAndNothingElse) {
+  SystemCalls calls;
+  calls.machineIdFile = home.root() / "machine-id";
+  const std::string id = TestHome::kMachine;
+  const auto found = [&](const std::string& content) {
+    std::ofstream(calls.machineIdFile, std::ios::binary | std::ios::trunc) << content;
+    const auto places = FilePreferences::systemPlaces();
+    EXPECT_EQ(places.machineIdError, 0) << "it was read: " << content;
+    return places.machineId;
+  };
+  EXPECT_EQ(found(id + "\n"), id);
+  EXPECT_EQ(found(id), id);
+  for (const std::string& other :
+       {std::string(), std::string("\n"), std::string("uninitialized\n"), id.substr(1) + "\n",
+        id.substr(1) + "\n\n", id + "0\n", id + "\n\n", "g" + id.substr(1), id.substr(1) + "A",
+        "../" + id.substr(3), id + "\n" + std::string(100, '0')}) {
+    EXPECT_EQ(found(other), "") << other;
+  }
+}
+
+TEST_F(FilePreferencesTest, AMachineIdThatCannotBeReadIsNoneWithTheReason) {
+  SystemCalls calls;
+  calls.machineIdFile = home.root();
+  EXPECT_EQ(FilePreferences::systemPlaces().machineId, "");
+  EXPECT_EQ(FilePreferences::systemPlaces().machineIdError, EISDIR);
+  calls.failOpen = ENFILE;
+  EXPECT_EQ(FilePreferences::systemPlaces().machineId, "");
+  EXPECT_EQ(FilePreferences::systemPlaces().machineIdError, ENFILE);
 }
 
 TEST_F(FilePreferencesTest, WithoutAHomeOrAMachineIdThoseScopesHoldNothing) {
@@ -218,6 +259,20 @@ TEST_F(FilePreferencesTest, AFileWhereAFolderBelongsFailsTheSetAndIsLeftAlone) {
   EXPECT_EQ(TestHome::read(home.home() / "Library"), "a file");
 }
 
+TEST_F(FilePreferencesTest, WithoutADescriptorForAFolderNoneIsMade) {
+  rlimit usual{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &usual), 0);
+  const auto next = static_cast<rlim_t>(UniqueFd(::dup(STDERR_FILENO)).get());
+  set(*ours, "key", "lost");
+  const rlimit one{next + 1, usual.rlim_max};  // the home itself
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &one), 0);
+  const bool isStored = sync(*ours);
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &usual), 0);
+  EXPECT_FALSE(isStored);
+  EXPECT_EQ(onlyLine(), line("open folder: Too many open files"));
+  EXPECT_TRUE(fs::is_empty(home.home()));
+}
+
 TEST_F(FilePreferencesTest, ADomainTooLongForAFileNameReadsAsEmptyAndFailsTheSet) {
   const std::string longest(NAME_MAX - 6, 'd');
   ours->setValue("key", PropertyList::boolean(true), longest, kUser, kHost);
@@ -257,6 +312,15 @@ TEST_F(FilePreferencesTest, WhatStandsInAFileOfOursIsNotWrittenAgainAndInAForeig
   ours->setValue("never there", {}, kDomain, kUser, kHost);
   ASSERT_TRUE(sync(*ours));
   EXPECT_TRUE(calls.trace.empty());
+}
+
+TEST_F(FilePreferencesTest, WhatAnotherWriterPutInPlaceOfAFileOfOursIsStoredAgain) {
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  home.write(kDomain, binary(PropertyList::dictionary(
+                          {{"key", PropertyList::string("value")}, {"their", PropertyList::string("own")}})));
+  SystemCalls calls;
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  EXPECT_EQ(calls.trace.size(), 4u) << "who knows whether the other writer synced it";
 }
 
 TEST_F(FilePreferencesTest, AValueTooDeepToBeReadAgainIsNotStoredAndSaidSoAndTheOthersAre) {
@@ -439,6 +503,90 @@ TEST_F(FilePreferencesTest, ASettledFileIsNotReadAgain) {
   EXPECT_TRUE(log.entries().empty());
 }
 
+TEST_F(FilePreferencesTest, AForeignFileThatHasSettledIsReadOnce) {
+  home.write(kDomain, binary(textDictionary("key", "theirs")));
+  makeOld(file);
+  SystemCalls calls;
+  for (int i = 0; i < 3; ++i) {
+    EXPECT_TRUE(sync(*ours));
+    EXPECT_EQ(get(*ours, "key"), "theirs");
+  }
+  EXPECT_EQ(calls.reads, 1);
+}
+
+TEST_F(FilePreferencesTest, AFileWrittenInPlaceWithTheSameSizeIsToldByItsTime) {
+  ASSERT_TRUE(setNow(*ours, "key", "one"));
+  home.write(kDomain, binary(textDictionary("key", "two")));
+  makeOld(file);
+  EXPECT_EQ(get(*ours, "key"), "two");
+  home.write(kDomain, binary(textDictionary("key", "six")));
+  makeOld(file, 1);
+  EXPECT_EQ(get(*ours, "key"), "six") << "a nanosecond is enough";
+}
+
+TEST_F(FilePreferencesTest, TheFileAsReadOrWrittenIsKeptOpenSoThatItsNumberStaysTaken) {
+  const auto links = [this] {
+    std::vector<nlink_t> found;
+    for (const auto& entry : fs::directory_iterator("/proc/self/fd")) {
+      std::error_code error;
+      const std::string target = fs::read_symlink(entry.path(), error);
+      struct stat facts;
+      if (target.starts_with(file.string()) && ::stat(entry.path().c_str(), &facts) == 0) {
+        found.push_back(facts.st_nlink);
+      }
+    }
+    return found;
+  };
+  home.write(kDomain, binary(textDictionary("key", "theirs")));
+  makeOld(file);
+  ASSERT_EQ(get(*ours, "key"), "theirs");
+  EXPECT_EQ(links(), std::vector<nlink_t>{1});
+  fs::remove(file);
+  EXPECT_EQ(links(), std::vector<nlink_t>{0});
+  EXPECT_EQ(get(*ours, "key"), "(none)");
+  EXPECT_TRUE(links().empty());
+}
+
+TEST_F(FilePreferencesTest, AFileWrittenInPlaceWhileItIsReadIsReadAgain) {
+  home.write(kDomain, binary(textDictionary("key", "old")));
+  makeOld(file);
+  SystemCalls calls;
+  calls.afterRead = [&] {
+    if (calls.reads == 1) home.write(kDomain, binary(textDictionary("key", "new and longer")));
+  };
+  EXPECT_EQ(get(*ours, "key"), "new and longer");
+  EXPECT_EQ(calls.reads, 2);
+  EXPECT_TRUE(log.entries().empty());
+  EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+}
+
+TEST_F(FilePreferencesTest, AFileThatNeverStandsStillIsReadThreeTimes) {
+  home.write(kDomain, binary(textDictionary("key", "1")));
+  SystemCalls calls;
+  calls.afterRead = [&] {
+    const auto size = static_cast<std::size_t>(calls.reads) + 1;
+    home.write(kDomain, binary(textDictionary("key", std::string(size, '1'))));
+  };
+  EXPECT_EQ(get(*ours, "key"), "111");
+  EXPECT_EQ(calls.reads, 3);
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(FilePreferencesTest, AFlushedDomainIsReadAgainThoughNothingTellsThatItsFileChanged) {
+  home.write(kDomain, binary(textDictionary("key", "one")));
+  makeOld(file);
+  ASSERT_EQ(get(*ours, "key"), "one");
+  home.write(kDomain, binary(textDictionary("key", "two")));
+  makeOld(file);
+  const std::string domain = kDomain;
+  const std::string unrelated = "com.example.unrelated";
+  ours->flushCachesForAnyUser(nullptr);
+  ours->flushCachesForAnyUser(&unrelated);
+  EXPECT_EQ(get(*ours, "key"), "one");
+  ours->flushCachesForAnyUser(&domain);
+  EXPECT_EQ(get(*ours, "key"), "two");
+}
+
 TEST_F(FilePreferencesTest, ARemovedFileIsAnEmptyDomain) {
   ASSERT_TRUE(setNow(*ours, "key", "value"));
   fs::remove_all(home.home() / "Library");
@@ -461,6 +609,67 @@ TEST_F(FilePreferencesTest, AWriterThatKeepsTheLockIsWaitedForOnlySoLong) {
   EXPECT_EQ(get(*hasty, "key"), "old") << "reading needs no lock";
   lock.reset();
   EXPECT_TRUE(setNow(*hasty, "key", "new"));
+}
+
+TEST_F(FilePreferencesTest, AWriterLooksForTheLockLessAndLessOftenUntilItsPatienceEnds) {
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  const UniqueFd lock(::open((home.folder() / ".brenvik-preferences.lock").c_str(), O_RDWR | O_CLOEXEC));
+  ASSERT_EQ(::flock(lock.get(), LOCK_EX), 0);
+  SystemCalls calls;
+  calls.steadyTime = 0ns;
+  int attempts = 0;
+  calls.beforeLock = [&] {
+    if (++attempts > 100) *calls.steadyTime += 1h;  // it does not pause
+  };
+  EXPECT_FALSE(setNow(*home.open(20ms), "key", "new"));
+  EXPECT_EQ(onlyLine(), line("lock: another writer does not let go of the lock"));
+  std::vector<std::chrono::nanoseconds> expected{50us, 100us, 200us, 400us, 800us, 1600us};
+  expected.resize(15, 2000us);
+  EXPECT_EQ(calls.pauses, expected);
+
+  calls.pauses.clear();
+  EXPECT_FALSE(setNow(*home.open(0ms), "key", "new"));
+  EXPECT_TRUE(calls.pauses.empty()) << "without patience it does not wait";
+  EXPECT_EQ(onDisk(), textDictionary("key", "old"));
+}
+
+TEST_F(FilePreferencesTest, ASignalDoesNotEndTheWaitForTheLockAndAnotherErrorDoes) {
+  {
+    const FailingCall interrupted("flock", EINTR);
+    EXPECT_TRUE(setNow(*ours, "key", "value"));
+    EXPECT_EQ(interrupted.failures(), 1);
+  }
+  const FailingCall refused("flock", ENOLCK, 0, FailingCall::HowOften::always);
+  EXPECT_FALSE(setNow(*ours, "key", "other"));
+  EXPECT_EQ(refused.failures(), 1);
+  EXPECT_EQ(onlyLine(), line("lock: No locks available"));
+  EXPECT_EQ(onDisk(), textDictionary("key", "value"));
+}
+
+TEST_F(FilePreferencesTest, ALockFileThatIsRemovedBeforeItIsLockedIsNotTheOneThatIsHeld) {
+  const fs::path lock = home.folder() / ".brenvik-preferences.lock";
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  SystemCalls calls;
+  calls.steadyTime = 0ns;
+  int attempts = 0;
+  calls.beforeLock = [&] {
+    if (++attempts == 1) fs::remove(lock);
+  };
+  EXPECT_TRUE(setNow(*ours, "key", "new"));
+  EXPECT_EQ(attempts, 2);
+  EXPECT_TRUE(fs::exists(lock)) << "others find the lock that was held";
+
+  // If that goes on, patience ends, too.
+  attempts = 0;
+  calls.beforeLock = [&] {
+    ++attempts;
+    *calls.steadyTime += 1ms;
+    fs::remove(lock);
+  };
+  EXPECT_FALSE(setNow(*home.open(20ms), "key", "newer"));
+  EXPECT_EQ(attempts, 20);
+  EXPECT_EQ(onlyLine(), line("lock: another writer does not let go of the lock"));
+  EXPECT_EQ(onDisk(), textDictionary("key", "new"));
 }
 
 TEST_F(FilePreferencesTest, ALockFileThatWasRemovedIsMadeAnew) {
@@ -490,6 +699,93 @@ TEST_F(FilePreferencesTest, ManyDomainsCostOnlySoManyDescriptors) {
   EXPECT_EQ(get(*ours, "waiting"), "still");
   ours.reset();
   EXPECT_EQ(descriptors(), before);
+}
+
+TEST_F(FilePreferencesTest, TheSixteenDomainsThatWereUsedLastAreKept) {
+  const auto read = [this](int number) {
+    SystemCalls calls;
+    EXPECT_TRUE(ours->copyValue("key", "d" + std::to_string(number), kUser, kHost));
+    return calls.reads;
+  };
+  for (int i = 0; i < 18; ++i) {
+    home.write("d" + std::to_string(i), binary(textDictionary("key", "value")));
+    makeOld(home.file("d" + std::to_string(i)));
+  }
+  for (int i = 0; i < 16; ++i) EXPECT_EQ(read(i), 1);
+  for (int i = 0; i < 16; ++i) EXPECT_EQ(read(i), 0) << i;
+  EXPECT_EQ(read(0), 0);
+  EXPECT_EQ(read(16), 1) << "in the place of d1, whose last use is the longest ago";
+  EXPECT_EQ(read(0), 0);
+  EXPECT_EQ(read(2), 0);
+  EXPECT_EQ(read(1), 1);
+}
+
+TEST_F(FilePreferencesTest, ADomainIsForgottenWhenWhatIsKeptExceedsSixteenMebibytes) {
+  const auto domain = [](std::size_t size) {
+    return binary(PropertyList::dictionary({{"key", PropertyList::string("value")},
+                                            {"large", PropertyList::data(std::vector<std::byte>(size))}}));
+  };
+  const auto memory = [](const std::string& bytes) {
+    auto values = EditableDictionary::of(parsePropertyList(std::as_bytes(std::span(bytes))));
+    EXPECT_TRUE(values && values->find("key"));
+    return values ? values->memory() : 0;
+  };
+  constexpr std::size_t kLimit = std::size_t{16} << 20;
+  std::size_t size = kLimit / 2;
+  size += kLimit - memory(domain(size));
+  ASSERT_EQ(memory(domain(size)), kLimit);
+  for (const std::size_t more : {0u, 1u}) {
+    home.write(kDomain, domain(size + more));
+    makeOld(file);
+    ASSERT_EQ(get(*ours, "key"), "value");
+    ours->copyValue("key", "another" + std::to_string(more), kUser, kHost);
+    SystemCalls calls;
+    ASSERT_EQ(get(*ours, "key"), "value");
+    EXPECT_EQ(calls.reads > 0, more > 0);
+  }
+}
+
+TEST_F(FilePreferencesTest, ALackOfMemoryIsLoggedAndWhatWasStoredStands) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "allocations do not fail in this build";
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  const std::string domain = kDomain;
+  const PropertyList value = PropertyList::string("new");
+  int set = 0;
+  int stored = 0;
+  for (long next = 0; stored == 0 || set == 0; ++next) {
+    const auto failure = [next](auto work) {
+      bool isThrown = false;
+      std::optional<FailingAllocations> failing(std::in_place, next, FailingAllocations::HowMany::one);
+      try {
+        work();
+      } catch (const std::bad_alloc&) {
+        isThrown = true;
+      }
+      failing.reset();
+      return isThrown;
+    };
+    SCOPED_TRACE(next);
+    if (failure([&] { ours->setValue("key", value, kDomain, kUser, kHost); })) {
+      EXPECT_EQ(onlyLine(), "Preferences: no memory to set a value");
+    } else {
+      ++set;
+    }
+    EXPECT_TRUE(log.entries().empty());
+    ours->setValue("key", value, kDomain, kUser, kHost);
+    if (failure([&] { EXPECT_TRUE(sync(*ours)); })) {
+      EXPECT_EQ(onlyLine(), "Preferences: no memory to store a domain");
+      EXPECT_EQ(get(*ours, "key"), "old") << "what was not stored is dropped";
+    } else {
+      ++stored;
+    }
+    EXPECT_TRUE(log.entries().empty());
+  }
+  EXPECT_EQ(onDisk(), textDictionary("key", "new"));
+  {
+    const FailingAllocations failing(0, FailingAllocations::HowMany::one);
+    ours->flushCachesForAnyUser(&domain);
+  }
+  EXPECT_EQ(onlyLine(), "Preferences: no memory to flush a domain");
 }
 
 TEST_F(FilePreferencesTest, SeveralThreadsShareAStore) {
@@ -617,6 +913,30 @@ TEST_F(DamagedPreferencesTest, ALackOfDescriptorsOrMemoryIsNoDamage) {
   }
   ASSERT_TRUE(sync(*ours));
   EXPECT_EQ(get(*ours, "key"), "old") << "when it is over, all is as it was";
+  EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+}
+
+TEST_F(DamagedPreferencesTest, AFileWhoseContentCannotBeReadIsMovedAside) {
+  home.write(kDomain, binary(textDictionary("key", "old")));
+  const FailingCall failing("pread", EIO, 0, FailingCall::HowOften::always);
+  expectMovedAside("Input/output error");
+}
+
+TEST_F(DamagedPreferencesTest, AReadThatASignalInterruptsIsRepeatedAndOneWithoutMemoryIsNoDamage) {
+  home.write(kDomain, binary(textDictionary("key", "old")));
+  {
+    const FailingCall interrupted("pread", EINTR);
+    EXPECT_EQ(get(*ours, "key"), "old");
+    EXPECT_EQ(interrupted.failures(), 1);
+    EXPECT_TRUE(log.entries().empty());
+  }
+  ours = home.open();
+  {
+    const FailingCall failing("pread", ENOMEM, 0, FailingCall::HowOften::always);
+    EXPECT_FALSE(setNow(*ours, "key", "new"));
+  }
+  EXPECT_EQ(onlyLine(), line("read: Cannot allocate memory"));
+  EXPECT_EQ(get(*ours, "key"), "old");
   EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
 }
 

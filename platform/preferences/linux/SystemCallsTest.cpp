@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <fcntl.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/uio.h>
@@ -8,8 +9,12 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <cstdarg>
+#include <ctime>
+#include <string_view>
 
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/preferences/linux/TestHome.h"
 
 namespace brenvik {
@@ -78,8 +83,46 @@ extern "C" int open(const char* path, int flags, ...) {
   } else if (current != nullptr && (flags & O_DIRECTORY) == 0 && brenvik::shallFail(current->failOpen)) {
     return -1;
   }
+  if (current != nullptr && !current->machineIdFile.empty() && std::string_view(path) == "/etc/machine-id") {
+    path = current->machineIdFile.c_str();
+    errno = EIO;  // a call that succeeds may leave any number
+  }
   return static_cast<int>(::syscall(SYS_openat, AT_FDCWD, path, flags, mode));
 }
 // What open() without a mode becomes where the C library's headers check calls (_FORTIFY_SOURCE).
 extern "C" int checkedOpen(const char* path, int flags) __asm__("__open_2");
 extern "C" int checkedOpen(const char* path, int flags) { return open(path, flags, 0); }
+
+extern "C" ssize_t pread(int file, void* bytes, std::size_t count, off_t offset) {
+  if (brenvik::FailingCall::failsNow("pread")) return -1;
+  const ssize_t got = ::syscall(SYS_pread64, file, bytes, count, offset);
+  if (current == nullptr) return got;
+  ++current->reads;
+  if (current->afterRead) current->afterRead();
+  return got;
+}
+
+extern "C" int flock(int file, int operation) noexcept {
+  if (current != nullptr && current->beforeLock) current->beforeLock();
+  if (brenvik::FailingCall::failsNow("flock")) return -1;
+  return static_cast<int>(::syscall(SYS_flock, file, operation));
+}
+
+extern "C" int clock_gettime(clockid_t clock, timespec* time) noexcept {
+  if (current == nullptr || !current->steadyTime || clock != CLOCK_MONOTONIC) {
+    return static_cast<int>(::syscall(SYS_clock_gettime, clock, time));
+  }
+  const auto seconds = std::chrono::floor<std::chrono::seconds>(*current->steadyTime);
+  *time = {seconds.count(), (*current->steadyTime - seconds).count()};
+  return 0;
+}
+
+extern "C" int nanosleep(const timespec* time, timespec* rest) {
+  if (current == nullptr || !current->steadyTime) {
+    return static_cast<int>(::syscall(SYS_nanosleep, time, rest));
+  }
+  const auto pause = std::chrono::seconds(time->tv_sec) + std::chrono::nanoseconds(time->tv_nsec);
+  current->pauses.push_back(pause);
+  *current->steadyTime += pause;
+  return 0;
+}

@@ -10,8 +10,10 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <iterator>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -82,6 +84,16 @@ struct SystemCalls {
   int failRename = 0;
   int failOpen = 0;         // of existing files, for reading
   int failRenameFlags = 0;  // of renames that must not replace anything
+  int reads = 0;            // calls of pread
+
+  std::function<void()> beforeLock;  // runs before each attempt to take a lock
+  std::function<void()> afterRead;   // runs after each call of pread
+  std::string machineIdFile;         // stands for /etc/machine-id, unless empty
+
+  // With a time, the steady clock stands still but for the pauses that are asked for, and nobody waits for
+  // them.
+  std::optional<std::chrono::nanoseconds> steadyTime;
+  std::vector<std::chrono::nanoseconds> pauses;
 
   SystemCalls();
   SystemCalls(const SystemCalls&) = delete;
