@@ -297,15 +297,17 @@ TEST_F(PreferenceTransferTest, AValueThatXmlCannotSayFailsTheCopy) {
   const auto binary = serializePropertyList(PropertyList::string("\x01"), PropertyListFormat::binary);
   ASSERT_TRUE(binary);
   ASSERT_EQ(set("com.example", "odd", *binary), kern::success);
-  // A text that there is not must not be looked at: with some bytes it would even pass for a good one.
+  // A text that does not exist must not be looked at: some bytes would pass for a good one.
+  Field domain("com.example");
+  Field key("odd");
   for (const char garbage : {'\0', 'Z'}) {
     payload = {&disk, 99};
     fillStack(garbage);
-    EXPECT_EQ(copy("com.example", "odd"), kern::failure);
+    EXPECT_EQ(transfer.copyPreferenceValue(kPort, domain, key, &payload), kern::failure);
     expectNoPayload();
     payload = {&disk, 99};
     fillStack(garbage);
-    EXPECT_EQ(copyApp("com.example", "odd"), kern::failure);
+    EXPECT_EQ(transfer.copyAppPreferenceValue(kPort, domain, key, &payload), kern::failure);
     expectNoPayload();
   }
   EXPECT_TRUE(log.entries().empty());

@@ -15,6 +15,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "platform/preferences/linux/FilePreferences.h"
@@ -86,14 +87,16 @@ struct SystemCalls {
   int failRenameFlags = 0;  // of renames that must not replace anything
   int reads = 0;            // calls of pread
 
-  std::function<void()> beforeLock;  // runs before each attempt to take a lock
-  std::function<void()> afterRead;   // runs after each call of pread
-  std::string machineIdFile;         // stands for /etc/machine-id, unless empty
+  // Runs before each call of "write", "fsync file", "fsync folder", "rename", "flock", "mkdir" and "read",
+  // and after "read" as "have read"; not for the calls that it makes itself.
+  std::function<void(std::string_view call)> hook;
+  std::string machineIdFile;  // stands for /etc/machine-id, unless empty
 
   // With a time, the steady clock stands still but for the pauses that are asked for, and nobody waits for
   // them.
   std::optional<std::chrono::nanoseconds> steadyTime;
   std::vector<std::chrono::nanoseconds> pauses;
+  std::optional<std::chrono::nanoseconds> wallTime;  // since 1970; stands still
 
   SystemCalls();
   SystemCalls(const SystemCalls&) = delete;
