@@ -227,6 +227,23 @@ TEST_F(PreferenceTransferTest, ACopySeesWhatAnotherProcessHasWrittenSince) {
   EXPECT_EQ(parse(content()).asString(), "new");
 }
 
+TEST_F(PreferenceTransferTest, ACopyFirstSynchronizesTheScopesThatItReads) {
+  const auto isStored = [this](const char* key, const PreferencesScope& scope) {
+    return bool(InMemoryPreferences(disk).copyValue(key, "com.example", scope.user, scope.host));
+  };
+  for (const char* const key : {"a", "b"}) {
+    for (const auto& scope : kApplicationScopes) {
+      preferences.setValue(key, PropertyList::boolean(true), "com.example", scope.user, scope.host);
+      EXPECT_FALSE(isStored(key, scope));
+    }
+    ASSERT_EQ(key == "a"s ? copy("com.example", key) : copyApp("com.example", key), kern::success);
+    for (const auto& scope : kApplicationScopes) {
+      const bool isUsers = scope.user == UserScope::currentUser && scope.host == HostScope::anyHost;
+      EXPECT_EQ(isStored(key, scope), key == "b"s || isUsers);
+    }
+  }
+}
+
 TEST_F(PreferenceTransferTest, OnlyApplicationScopeSeesOtherHostsAndUsers) {
   InMemoryPreferences other(disk);
   other.setValue("wide", PropertyList::string("any user"), "com.example", UserScope::anyUser,

@@ -4,6 +4,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <pwd.h>
 #include <sched.h>
 #include <sys/file.h>
 #include <sys/mount.h>
@@ -14,6 +15,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstdio>
@@ -23,6 +25,8 @@
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/base/fakes/FailingAllocations.h"
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/log/fakes/RecordingLog.h"
 #include "platform/plist/EditableDictionary.h"
 #include "platform/plist/PropertyListCodec.h"
@@ -43,6 +47,12 @@ std::string binary(const PropertyList& value) {
 
 PropertyList textDictionary(const std::string& key, const std::string& text) {
   return PropertyList::dictionary({{key, PropertyList::string(text)}});
+}
+
+// Sets a time that is long past, so that the file does not count as young.
+void makeOld(const fs::path& path, long nanoseconds = 0) {
+  const timespec old[2] = {{1'000'000, nanoseconds}, {1'000'000, nanoseconds}};
+  ASSERT_EQ(::utimensat(AT_FDCWD, path.c_str(), old, 0), 0);
 }
 
 mode_t modeOf(const fs::path& path) {
@@ -133,9 +143,52 @@ TEST_F(FilePreferencesTest, PlacesThatAreKnownAreAskedForOnceAndNotBeforeTheyAre
 
 TEST_F(FilePreferencesTest, TheSystemsPlacesAreTheEffectiveUsersHomeAndTheMachinesId) {
   const auto places = FilePreferences::systemPlaces();
-  EXPECT_TRUE(places.home.starts_with("/"));
+  const passwd* const account = ::getpwuid(::geteuid());
+  ASSERT_NE(account, nullptr);
+  EXPECT_EQ(places.home, account->pw_dir);
   EXPECT_TRUE(places.anyUser.starts_with("/"));
   EXPECT_TRUE(places.machineId.empty() || places.machineId.size() == 32);
+}
+
+TEST_F(FilePreferencesTest, AMachineIdIs32LowerCaseHexadecimalDigitsAndNothingElse) {
+  SystemCalls calls;
+  calls.machineIdFile = home.root() / "machine-id";
+  const std::string id = TestHome::kMachine;
+  const auto found = [&](const std::string& content) {
+    std::ofstream(calls.machineIdFile, std::ios::binary | std::ios::trunc) << content;
+    const auto places = FilePreferences::systemPlaces();
+    EXPECT_EQ(places.machineIdError, 0) << "it was read: " << content;
+    return places.machineId;
+  };
+  EXPECT_EQ(found(id + "\n"), id);
+  EXPECT_EQ(found(id), id);
+  for (const std::string& other :
+       {std::string(), std::string("\n"), std::string("uninitialized\n"), id.substr(1) + "\n",
+        id.substr(1) + "\n\n", id + "0\n", id + "\n\n", "g" + id.substr(1), id.substr(1) + "A",
+        "../" + id.substr(3), id + "\n" + std::string(100, '0')}) {
+    EXPECT_EQ(found(other), "") << other;
+  }
+}
+
+TEST_F(FilePreferencesTest, AMachineIdThatCannotBeReadIsNoneWithTheReason) {
+  SystemCalls calls;
+  calls.machineIdFile = home.root();
+  EXPECT_EQ(FilePreferences::systemPlaces().machineId, "");
+  EXPECT_EQ(FilePreferences::systemPlaces().machineIdError, EISDIR);
+  calls.failOpen = ENFILE;
+  EXPECT_EQ(FilePreferences::systemPlaces().machineId, "");
+  EXPECT_EQ(FilePreferences::systemPlaces().machineIdError, ENFILE);
+}
+
+TEST_F(FilePreferencesTest, AHomeThatCannotBeLookedUpIsNoneWithTheReasonAndALackOfMemoryIsThrown) {
+  {
+    const FailingCall failing("getpwuid_r", EIO);
+    const auto places = FilePreferences::systemPlaces();
+    EXPECT_EQ(places.home, "");
+    EXPECT_EQ(places.homeError, EIO);
+  }
+  const FailingCall failing("getpwuid_r", ENOMEM);
+  EXPECT_THROW(FilePreferences::systemPlaces(), std::bad_alloc);
 }
 
 TEST_F(FilePreferencesTest, WithoutAHomeOrAMachineIdThoseScopesHoldNothing) {
@@ -218,6 +271,68 @@ TEST_F(FilePreferencesTest, AFileWhereAFolderBelongsFailsTheSetAndIsLeftAlone) {
   EXPECT_EQ(TestHome::read(home.home() / "Library"), "a file");
 }
 
+TEST_F(FilePreferencesTest, WithoutADescriptorForAFolderNoneIsMade) {
+  rlimit usual{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &usual), 0);
+  const auto next = static_cast<rlim_t>(UniqueFd(::dup(STDERR_FILENO)).get());
+  set(*ours, "key", "lost");
+  const rlimit one{next + 1, usual.rlim_max};  // the home itself
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &one), 0);
+  const bool isStored = sync(*ours);
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &usual), 0);
+  EXPECT_FALSE(isStored);
+  EXPECT_EQ(onlyLine(), line("open folder: Too many open files"));
+  EXPECT_TRUE(fs::is_empty(home.home()));
+}
+
+TEST_F(FilePreferencesTest, AFolderNameHasAtMost255Bytes) {
+  auto places = home.places();
+  for (const std::size_t size : {256u, 255u}) {
+    places.anyUser = home.root() / std::string(size, 'n');
+    FilePreferences any([&places] { return places; });
+    any.setValue("key", PropertyList::boolean(true), "d", UserScope::anyUser, kHost);
+    EXPECT_EQ(any.synchronize("d", UserScope::anyUser, kHost), size == 255);
+    if (size > 255) {
+      EXPECT_TRUE(onlyLine().ends_with(": mkdir: File name too long"));
+    }
+  }
+  EXPECT_TRUE(log.entries().empty());
+  EXPECT_TRUE(fs::exists(fs::path(places.anyUser) / "d.plist"));
+}
+
+TEST_F(FilePreferencesTest, AFolderThatSomeoneElseMakesMeanwhileIsTakenAsItIs) {
+  SystemCalls calls;
+  calls.hook = [&](std::string_view call) {
+    if (call != "mkdir" || fs::exists(home.home() / "Library")) return;
+    ASSERT_EQ(::mkdir((home.home() / "Library").c_str(), 0700), 0);
+    ASSERT_EQ(::chmod((home.home() / "Library").c_str(), 0750), 0);
+  };
+  EXPECT_TRUE(setNow(*ours, "key", "value"));
+  EXPECT_EQ(modeOf(home.home() / "Library"), 0750u);
+  EXPECT_EQ(modeOf(home.folder()), 0700u);
+}
+
+TEST_F(FilePreferencesTest, AFolderThatCannotBeMadeAsItShouldBeFailsTheSet) {
+  {
+    const FailingCall failing("mkdirat", EROFS);
+    EXPECT_FALSE(setNow(*ours, "key", "value"));
+    EXPECT_EQ(onlyLine(), line("mkdir: Read-only file system"));
+  }
+  {
+    const FailingCall failing("fchmod", EPERM);
+    EXPECT_FALSE(setNow(*ours, "key", "value"));
+    EXPECT_EQ(onlyLine(), line("mkdir: Operation not permitted"));
+  }
+  fs::remove(home.home() / "Library");
+  {
+    SystemCalls calls;
+    calls.failFolderSync = EIO;
+    EXPECT_FALSE(setNow(*ours, "key", "value"));
+    EXPECT_EQ(onlyLine(), line("mkdir: Input/output error"));
+  }
+  EXPECT_TRUE(setNow(*ours, "key", "value"));
+}
+
 TEST_F(FilePreferencesTest, ADomainTooLongForAFileNameReadsAsEmptyAndFailsTheSet) {
   const std::string longest(NAME_MAX - 6, 'd');
   ours->setValue("key", PropertyList::boolean(true), longest, kUser, kHost);
@@ -257,6 +372,15 @@ TEST_F(FilePreferencesTest, WhatStandsInAFileOfOursIsNotWrittenAgainAndInAForeig
   ours->setValue("never there", {}, kDomain, kUser, kHost);
   ASSERT_TRUE(sync(*ours));
   EXPECT_TRUE(calls.trace.empty());
+}
+
+TEST_F(FilePreferencesTest, WhatAnotherWriterPutInPlaceOfAFileOfOursIsStoredAgain) {
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  home.write(kDomain, binary(PropertyList::dictionary(
+                          {{"key", PropertyList::string("value")}, {"their", PropertyList::string("own")}})));
+  SystemCalls calls;
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  EXPECT_EQ(calls.trace.size(), 4u) << "who knows whether the other writer synced it";
 }
 
 TEST_F(FilePreferencesTest, AValueTooDeepToBeReadAgainIsNotStoredAndSaidSoAndTheOthersAre) {
@@ -318,6 +442,73 @@ TEST_F(FilePreferencesTest, WhatADeadWriterLeftIsClearedAway) {
   ASSERT_TRUE(setNow(*ours, "key", "other"));
   EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
   EXPECT_EQ(onDisk(), textDictionary("key", "other"));
+}
+
+TEST_F(FilePreferencesTest, WhatStandsInTheWayOfATemporaryFileFailsTheSet) {
+  fs::create_directories(home.folder() / ".brenvik-preferences.tmp");
+  EXPECT_FALSE(setNow(*ours, "key", "value"));
+  EXPECT_EQ(onlyLine(), line("remove an old temporary file: Is a directory"));
+  EXPECT_FALSE(fs::exists(file));
+}
+
+TEST_F(FilePreferencesTest, AUsersFileIsNeverReadableByOthersWhateverTheUmask) {
+  const mode_t mask = ::umask(0);
+  SystemCalls calls;
+  const fs::path temporary = home.folder() / ".brenvik-preferences.tmp";
+  calls.hook = [&](std::string_view call) {
+    if (call == "write") {
+      EXPECT_EQ(modeOf(temporary), 0600u);
+    }
+  };
+  EXPECT_TRUE(setNow(*ours, "key", "value"));
+  EXPECT_EQ(modeOf(file), 0600u);
+  std::ofstream(temporary) << "half a fi";
+  EXPECT_TRUE(setNow(*ours, "key", "other"));
+  EXPECT_EQ(modeOf(file), 0600u);
+  EXPECT_EQ(modeOf(home.folder() / ".brenvik-preferences.lock"), 0600u);
+  ::umask(mask);
+}
+
+TEST_F(FilePreferencesTest, AFileForAnyUserThatCannotBeOpenedUpFailsTheSetAndAUsersFileIsNotTried) {
+  ASSERT_TRUE(setNow(*ours, "key", "value"));
+  ours->setValue("key", PropertyList::integer(1), "d", UserScope::anyUser, kHost);
+  ASSERT_TRUE(ours->synchronize("d", UserScope::anyUser, kHost));
+  const FailingCall failing("fchmod", EPERM, 0, FailingCall::HowOften::always);
+  EXPECT_TRUE(setNow(*ours, "key", "other"));
+  EXPECT_EQ(failing.failures(), 0);
+  ours->setValue("key", PropertyList::integer(2), "d", UserScope::anyUser, kHost);
+  EXPECT_FALSE(ours->synchronize("d", UserScope::anyUser, kHost));
+  EXPECT_TRUE(onlyLine().ends_with(": chmod: Operation not permitted"));
+  EXPECT_EQ(ours->copyValue("key", "d", UserScope::anyUser, kHost).asInteger(), 1);
+  EXPECT_FALSE(fs::exists(home.anyUser() / ".brenvik-preferences.tmp"));
+}
+
+TEST_F(FilePreferencesTest, NoDescriptorIsInheritedByAProgramThatIsStartedMeanwhile) {
+  const auto inherited = [] {
+    std::vector<std::string> found;
+    for (int fd = 0; fd < 256; ++fd) {
+      const int flags = ::fcntl(fd, F_GETFD);
+      if (flags >= 0 && (flags & FD_CLOEXEC) == 0) found.push_back(std::to_string(fd));
+    }
+    return found;
+  };
+  const auto before = inherited();
+  home.write(kDomain, binary(textDictionary("key", "theirs")));
+  std::ofstream(home.folder() / ".brenvik-preferences.tmp") << "half a fi";
+  SystemCalls calls;
+  std::vector<std::string> seen;
+  calls.hook = [&](std::string_view call) {
+    seen.emplace_back(call);
+    EXPECT_EQ(inherited(), before) << call;
+  };
+  EXPECT_TRUE(setNow(*ours, "key", "value"));
+  EXPECT_TRUE(setNow(*ours, "key", "other"));
+  ours->setValue("key", PropertyList::boolean(true), kDomain, UserScope::anyUser, kHost);
+  EXPECT_TRUE(ours->synchronize(kDomain, UserScope::anyUser, kHost));
+  for (const char* const call : {"flock", "read", "write", "fsync file", "rename", "mkdir"}) {
+    EXPECT_NE(std::find(seen.begin(), seen.end(), call), seen.end()) << call;
+  }
+  EXPECT_EQ(inherited(), before);
 }
 
 TEST_F(FilePreferencesTest, NothingIsWrittenThroughLinks) {
@@ -439,6 +630,142 @@ TEST_F(FilePreferencesTest, ASettledFileIsNotReadAgain) {
   EXPECT_TRUE(log.entries().empty());
 }
 
+TEST_F(FilePreferencesTest, AForeignFileThatHasSettledIsReadOnceAlsoThroughALink) {
+  home.write(kDomain, binary(textDictionary("key", "theirs")));
+  makeOld(file);
+  for (const bool isLink : {false, true}) {
+    if (isLink) {
+      fs::rename(file, home.folder() / "target");
+      fs::create_symlink("target", file);
+      ours = home.open();
+    }
+    SystemCalls calls;
+    for (int i = 0; i < 3; ++i) {
+      EXPECT_TRUE(sync(*ours));
+      EXPECT_EQ(get(*ours, "key"), "theirs");
+    }
+    EXPECT_EQ(calls.reads, 1);
+  }
+}
+
+TEST_F(FilePreferencesTest, AFileWrittenInPlaceWithTheSameSizeIsToldByItsTime) {
+  ASSERT_TRUE(setNow(*ours, "key", "one"));
+  home.write(kDomain, binary(textDictionary("key", "two")));
+  makeOld(file);
+  EXPECT_EQ(get(*ours, "key"), "two");
+  home.write(kDomain, binary(textDictionary("key", "six")));
+  makeOld(file, 1);
+  EXPECT_EQ(get(*ours, "key"), "six") << "a nanosecond is enough";
+}
+
+TEST_F(FilePreferencesTest, TheFileAsReadOrWrittenIsKeptOpenSoThatItsNumberStaysTaken) {
+  // Of the domain's files that are open: the number of names that each has left.
+  const auto links = [this] {
+    std::vector<nlink_t> found;
+    for (const auto& entry : fs::directory_iterator("/proc/self/fd")) {
+      std::error_code error;
+      const std::string target = fs::read_symlink(entry.path(), error);
+      struct stat facts;
+      if (target.starts_with(file.string()) && ::stat(entry.path().c_str(), &facts) == 0) {
+        found.push_back(facts.st_nlink);
+      }
+    }
+    return found;
+  };
+  const auto expectKeptAfterItsRemoval = [&] {
+    EXPECT_EQ(links(), std::vector<nlink_t>{1});
+    fs::remove(file);
+    EXPECT_EQ(links(), std::vector<nlink_t>{0});
+    EXPECT_EQ(get(*ours, "key"), "(none)");
+    EXPECT_TRUE(links().empty());
+  };
+  home.write(kDomain, binary(textDictionary("key", "theirs")));
+  makeOld(file);
+  ASSERT_EQ(get(*ours, "key"), "theirs");
+  expectKeptAfterItsRemoval();
+
+  ASSERT_TRUE(setNow(*ours, "key", "ours"));
+  SystemCalls calls;
+  calls.hook = [&](std::string_view call) {
+    if (call == "rename") {
+      EXPECT_TRUE(links().empty()) << "the old file goes with its name, at once";
+    }
+  };
+  ASSERT_TRUE(setNow(*ours, "key", "again"));
+  expectKeptAfterItsRemoval();
+}
+
+TEST_F(FilePreferencesTest, AFileWrittenInPlaceWhileItIsReadIsReadAgain) {
+  home.write(kDomain, binary(textDictionary("key", "old")));
+  makeOld(file);
+  SystemCalls calls;
+  calls.hook = [&](std::string_view call) {
+    if (call == "have read" && calls.reads == 1)
+      home.write(kDomain, binary(textDictionary("key", "new and longer")));
+  };
+  EXPECT_EQ(get(*ours, "key"), "new and longer");
+  EXPECT_EQ(calls.reads, 2);
+  EXPECT_TRUE(log.entries().empty());
+  EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+}
+
+TEST_F(FilePreferencesTest, AFileThatNeverStandsStillIsReadThreeTimes) {
+  home.write(kDomain, binary(textDictionary("key", "1")));
+  SystemCalls calls;
+  calls.hook = [&](std::string_view call) {
+    if (call != "have read") return;
+    const auto size = static_cast<std::size_t>(calls.reads) + 1;
+    home.write(kDomain, binary(textDictionary("key", std::string(size, '1'))));
+  };
+  EXPECT_EQ(get(*ours, "key"), "111");
+  EXPECT_EQ(calls.reads, 3);
+  EXPECT_TRUE(log.entries().empty());
+}
+
+TEST_F(FilePreferencesTest, AFileThatGetsShorterWhileItIsReadIsNotTakenForDamaged) {
+  home.write(kDomain, binary(textDictionary("key", std::string(100, '1'))));
+  SystemCalls calls;
+  calls.hook = [&](std::string_view call) {
+    if (call != "read") return;
+    const auto size = static_cast<std::size_t>(std::max(90 - 10 * calls.reads, 1));
+    home.write(kDomain, binary(textDictionary("key", std::string(size, '1'))));
+  };
+  // Each of three rounds reads what there is and then finds the end.
+  EXPECT_EQ(get(*ours, "key"), std::string(50, '1'));
+  EXPECT_EQ(calls.reads, 6);
+  EXPECT_TRUE(log.entries().empty());
+  EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+}
+
+TEST_F(FilePreferencesTest, AFileHasSettledMoreThanFiftyMillisecondsAfterItsTime) {
+  home.write(kDomain, binary(textDictionary("key", "value")));
+  makeOld(file);
+  SystemCalls calls;
+  calls.wallTime = 1'000'000s + 50ms;
+  for (int i = 1; i <= 3; ++i) {
+    EXPECT_EQ(get(*ours, "key"), "value");
+    EXPECT_EQ(calls.reads, i) << "it may change within the same tick of the clock";
+  }
+  *calls.wallTime += 1ns;
+  for (int i = 0; i < 3; ++i) EXPECT_EQ(get(*ours, "key"), "value");
+  EXPECT_EQ(calls.reads, 4);
+}
+
+TEST_F(FilePreferencesTest, AFlushedDomainIsReadAgainThoughNothingTellsThatItsFileChanged) {
+  home.write(kDomain, binary(textDictionary("key", "one")));
+  makeOld(file);
+  ASSERT_EQ(get(*ours, "key"), "one");
+  home.write(kDomain, binary(textDictionary("key", "two")));
+  makeOld(file);
+  const std::string domain = kDomain;
+  const std::string unrelated = "com.example.unrelated";
+  ours->flushCachesForAnyUser(nullptr);
+  ours->flushCachesForAnyUser(&unrelated);
+  EXPECT_EQ(get(*ours, "key"), "one");
+  ours->flushCachesForAnyUser(&domain);
+  EXPECT_EQ(get(*ours, "key"), "two");
+}
+
 TEST_F(FilePreferencesTest, ARemovedFileIsAnEmptyDomain) {
   ASSERT_TRUE(setNow(*ours, "key", "value"));
   fs::remove_all(home.home() / "Library");
@@ -461,6 +788,68 @@ TEST_F(FilePreferencesTest, AWriterThatKeepsTheLockIsWaitedForOnlySoLong) {
   EXPECT_EQ(get(*hasty, "key"), "old") << "reading needs no lock";
   lock.reset();
   EXPECT_TRUE(setNow(*hasty, "key", "new"));
+}
+
+TEST_F(FilePreferencesTest, AWriterLooksForTheLockLessAndLessOftenUntilItsPatienceEnds) {
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  const UniqueFd lock(::open((home.folder() / ".brenvik-preferences.lock").c_str(), O_RDWR | O_CLOEXEC));
+  ASSERT_EQ(::flock(lock.get(), LOCK_EX), 0);
+  SystemCalls calls;
+  calls.steadyTime = 0ns;
+  int attempts = 0;
+  calls.hook = [&](std::string_view call) {
+    if (call == "flock" && ++attempts > 100) *calls.steadyTime += 1h;  // it does not pause
+  };
+  EXPECT_FALSE(setNow(*home.open(20ms), "key", "new"));
+  EXPECT_EQ(onlyLine(), line("lock: another writer does not let go of the lock"));
+  std::vector<std::chrono::nanoseconds> expected{50us, 100us, 200us, 400us, 800us, 1600us};
+  expected.resize(15, 2000us);
+  EXPECT_EQ(calls.pauses, expected);
+
+  calls.pauses.clear();
+  EXPECT_FALSE(setNow(*home.open(0ms), "key", "new"));
+  EXPECT_TRUE(calls.pauses.empty()) << "without patience it does not wait";
+  EXPECT_EQ(onDisk(), textDictionary("key", "old"));
+}
+
+TEST_F(FilePreferencesTest, ASignalDoesNotEndTheWaitForTheLockAndAnotherErrorDoes) {
+  {
+    const FailingCall interrupted("flock", EINTR);
+    EXPECT_TRUE(setNow(*ours, "key", "value"));
+    EXPECT_EQ(interrupted.failures(), 1);
+  }
+  const FailingCall refused("flock", ENOLCK, 0, FailingCall::HowOften::always);
+  EXPECT_FALSE(setNow(*ours, "key", "other"));
+  EXPECT_EQ(refused.failures(), 1);
+  EXPECT_EQ(onlyLine(), line("lock: No locks available"));
+  EXPECT_EQ(onDisk(), textDictionary("key", "value"));
+}
+
+TEST_F(FilePreferencesTest, ALockFileThatIsRemovedBeforeItIsLockedIsNotTheOneThatIsHeld) {
+  const fs::path lock = home.folder() / ".brenvik-preferences.lock";
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  SystemCalls calls;
+  calls.steadyTime = 0ns;
+  int attempts = 0;
+  calls.hook = [&](std::string_view call) {
+    if (call == "flock" && ++attempts == 1) fs::remove(lock);
+  };
+  EXPECT_TRUE(setNow(*ours, "key", "new"));
+  EXPECT_EQ(attempts, 2);
+  EXPECT_TRUE(fs::exists(lock)) << "others find the lock that was held";
+
+  // If that goes on, patience ends, too.
+  attempts = 0;
+  calls.hook = [&](std::string_view call) {
+    if (call != "flock") return;
+    ++attempts;
+    *calls.steadyTime += 1ms;
+    fs::remove(lock);
+  };
+  EXPECT_FALSE(setNow(*home.open(20ms), "key", "newer"));
+  EXPECT_EQ(attempts, 20);
+  EXPECT_EQ(onlyLine(), line("lock: another writer does not let go of the lock"));
+  EXPECT_EQ(onDisk(), textDictionary("key", "new"));
 }
 
 TEST_F(FilePreferencesTest, ALockFileThatWasRemovedIsMadeAnew) {
@@ -490,6 +879,93 @@ TEST_F(FilePreferencesTest, ManyDomainsCostOnlySoManyDescriptors) {
   EXPECT_EQ(get(*ours, "waiting"), "still");
   ours.reset();
   EXPECT_EQ(descriptors(), before);
+}
+
+TEST_F(FilePreferencesTest, TheSixteenDomainsThatWereUsedLastAreKept) {
+  const auto read = [this](int number) {
+    SystemCalls calls;
+    EXPECT_TRUE(ours->copyValue("key", "d" + std::to_string(number), kUser, kHost));
+    return calls.reads;
+  };
+  for (int i = 0; i < 18; ++i) {
+    home.write("d" + std::to_string(i), binary(textDictionary("key", "value")));
+    makeOld(home.file("d" + std::to_string(i)));
+  }
+  for (int i = 0; i < 16; ++i) EXPECT_EQ(read(i), 1);
+  for (int i = 0; i < 16; ++i) EXPECT_EQ(read(i), 0) << i;
+  EXPECT_EQ(read(0), 0);
+  EXPECT_EQ(read(16), 1) << "in the place of d1, whose last use is the longest ago";
+  EXPECT_EQ(read(0), 0);
+  EXPECT_EQ(read(2), 0);
+  EXPECT_EQ(read(1), 1);
+}
+
+TEST_F(FilePreferencesTest, ADomainIsForgottenWhenWhatIsKeptExceedsSixteenMebibytes) {
+  const auto domain = [](std::size_t size) {
+    return binary(PropertyList::dictionary({{"key", PropertyList::string("value")},
+                                            {"large", PropertyList::data(std::vector<std::byte>(size))}}));
+  };
+  const auto memory = [](const std::string& bytes) {
+    auto values = EditableDictionary::of(parsePropertyList(std::as_bytes(std::span(bytes))));
+    EXPECT_TRUE(values && values->find("key"));
+    return values ? values->memory() : 0;
+  };
+  constexpr std::size_t kLimit = std::size_t{16} << 20;
+  std::size_t size = kLimit / 2;
+  size += kLimit - memory(domain(size));
+  ASSERT_EQ(memory(domain(size)), kLimit);
+  for (const std::size_t more : {0u, 1u}) {
+    home.write(kDomain, domain(size + more));
+    makeOld(file);
+    ASSERT_EQ(get(*ours, "key"), "value");
+    ours->copyValue("key", "another" + std::to_string(more), kUser, kHost);
+    SystemCalls calls;
+    ASSERT_EQ(get(*ours, "key"), "value");
+    EXPECT_EQ(calls.reads > 0, more > 0);
+  }
+}
+
+TEST_F(FilePreferencesTest, ALackOfMemoryIsLoggedAndWhatWasStoredStands) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "allocations do not fail in this build";
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  const std::string domain = kDomain;
+  const PropertyList value = PropertyList::string("new");
+  int set = 0;
+  int stored = 0;
+  for (long next = 0; stored == 0 || set == 0; ++next) {
+    const auto failure = [next](auto work) {
+      bool isThrown = false;
+      std::optional<FailingAllocations> failing(std::in_place, next, FailingAllocations::HowMany::one);
+      try {
+        work();
+      } catch (const std::bad_alloc&) {
+        isThrown = true;
+      }
+      failing.reset();
+      return isThrown;
+    };
+    SCOPED_TRACE(next);
+    if (failure([&] { ours->setValue("key", value, kDomain, kUser, kHost); })) {
+      EXPECT_EQ(onlyLine(), "Preferences: no memory to set a value");
+    } else {
+      ++set;
+    }
+    EXPECT_TRUE(log.entries().empty());
+    ours->setValue("key", value, kDomain, kUser, kHost);
+    if (failure([&] { EXPECT_TRUE(sync(*ours)); })) {
+      EXPECT_EQ(onlyLine(), "Preferences: no memory to store a domain");
+      EXPECT_EQ(get(*ours, "key"), "old") << "what was not stored is dropped";
+    } else {
+      ++stored;
+    }
+    EXPECT_TRUE(log.entries().empty());
+  }
+  EXPECT_EQ(onDisk(), textDictionary("key", "new"));
+  {
+    const FailingAllocations failing(0, FailingAllocations::HowMany::one);
+    ours->flushCachesForAnyUser(&domain);
+  }
+  EXPECT_EQ(onlyLine(), "Preferences: no memory to flush a domain");
 }
 
 TEST_F(FilePreferencesTest, SeveralThreadsShareAStore) {
@@ -571,6 +1047,39 @@ TEST_F(DamagedPreferencesTest, AHugeFileIsMovedAsideUnread) {
   EXPECT_EQ(fs::file_size(aside()), std::uintmax_t{1} << 30);
 }
 
+TEST_F(DamagedPreferencesTest, AFileOfThirtyTwoMebibytesIsReadAndALargerOneIsNot) {
+  constexpr off_t kLimit = off_t{32} << 20;
+  home.write(kDomain, "");
+  ASSERT_EQ(::truncate(file.c_str(), kLimit), 0);
+  expectMovedAside("not a property list");
+  home.write(kDomain, "");
+  ASSERT_EQ(::truncate(file.c_str(), kLimit + 1), 0);
+  expectMovedAside("too large", 2);
+}
+
+TEST_F(DamagedPreferencesTest, AReaderMovesNothingAsideWhileAnotherWriterHoldsTheLock) {
+  home.write(kDomain, "garbage");
+  UniqueFd lock(
+      ::open((home.folder() / ".brenvik-preferences.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+  ASSERT_EQ(::flock(lock.get(), LOCK_EX), 0);
+  const auto hasty = home.open(0ms);
+  EXPECT_EQ(get(*hasty, "key"), "(none)");
+  EXPECT_EQ(onlyLine(), line("lock: another writer does not let go of the lock"));
+  EXPECT_EQ(TestHome::read(file), "garbage");
+  EXPECT_FALSE(fs::exists(aside()));
+}
+
+TEST_F(DamagedPreferencesTest, AGoodFileThatAnotherWriterPutThereMeanwhileIsReadAndStays) {
+  home.write(kDomain, "garbage");
+  SystemCalls calls;
+  calls.hook = [&](std::string_view call) {
+    if (call == "flock") home.write(kDomain, binary(textDictionary("key", "theirs")));
+  };
+  EXPECT_EQ(get(*ours, "key"), "theirs");
+  EXPECT_TRUE(log.entries().empty());
+  EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+}
+
 TEST_F(DamagedPreferencesTest, WhatIsNoFileIsMovedAsideAndNothingWaitsForIt) {
   fs::create_directories(file / "inside");
   expectMovedAside("not a regular file");
@@ -606,7 +1115,7 @@ TEST_F(DamagedPreferencesTest, AnUnreadableFileIsMovedAside) {
 
 TEST_F(DamagedPreferencesTest, ALackOfDescriptorsOrMemoryIsNoDamage) {
   home.write(kDomain, binary(textDictionary("key", "old")));
-  for (const int error : {EMFILE, ENFILE, ENOMEM}) {
+  for (const int error : {EMFILE, ENFILE, ENOMEM, EINTR, EAGAIN}) {
     SystemCalls calls;
     calls.failOpen = error;
     EXPECT_FALSE(setNow(*ours, "key", "new"));
@@ -620,6 +1129,30 @@ TEST_F(DamagedPreferencesTest, ALackOfDescriptorsOrMemoryIsNoDamage) {
   EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
 }
 
+TEST_F(DamagedPreferencesTest, AFileWhoseContentCannotBeReadIsMovedAside) {
+  home.write(kDomain, binary(textDictionary("key", "old")));
+  const FailingCall failing("pread", EIO, 0, FailingCall::HowOften::always);
+  expectMovedAside("Input/output error");
+}
+
+TEST_F(DamagedPreferencesTest, AReadThatASignalInterruptsIsRepeatedAndOneWithoutMemoryIsNoDamage) {
+  home.write(kDomain, binary(textDictionary("key", "old")));
+  {
+    const FailingCall interrupted("pread", EINTR);
+    EXPECT_EQ(get(*ours, "key"), "old");
+    EXPECT_EQ(interrupted.failures(), 1);
+    EXPECT_TRUE(log.entries().empty());
+  }
+  ours = home.open();
+  {
+    const FailingCall failing("pread", ENOMEM, 0, FailingCall::HowOften::always);
+    EXPECT_FALSE(setNow(*ours, "key", "new"));
+  }
+  EXPECT_EQ(onlyLine(), line("read: Cannot allocate memory"));
+  EXPECT_EQ(get(*ours, "key"), "old");
+  EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+}
+
 TEST_F(DamagedPreferencesTest, WhatCannotBeMovedAsideIsNotWrittenOver) {
   home.write(kDomain, "garbage");
   {
@@ -630,6 +1163,13 @@ TEST_F(DamagedPreferencesTest, WhatCannotBeMovedAsideIsNotWrittenOver) {
               line("damaged (not a property list) and cannot be moved aside (Permission denied); nothing is "
                    "stored there"));
     EXPECT_EQ(TestHome::read(file), "garbage");
+    const FailingCall failing("renameat2", EACCES, 0, FailingCall::HowOften::always);
+    EXPECT_FALSE(setNow(*ours, "key", "value"));
+    EXPECT_EQ(failing.failures(), 1) << "other names would not help";
+    log.clear();
+  }
+  {
+    SystemCalls calls;
     // File systems that know no flags of rename: looked at first, then renamed.
     calls.failRenameFlags = EINVAL;
     std::ofstream(aside()) << "an earlier one";
@@ -644,7 +1184,7 @@ TEST_F(DamagedPreferencesTest, ADamagedFileOfTheLongestNameIsMovedAsideToo) {
   home.write(longest, "garbage");
   ours->setValue("key", PropertyList::boolean(true), longest, kUser, kHost);
   EXPECT_TRUE(ours->synchronize(longest, kUser, kHost));
-  EXPECT_EQ(home.files().size(), 2u);
+  EXPECT_EQ(home.files(), (std::vector{longest.substr(0, NAME_MAX - 10) + ".damaged-1", longest + ".plist"}));
 }
 
 TEST_F(DamagedPreferencesTest, ADanglingLinkIsAnEmptyDomain) {

@@ -10,9 +10,12 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <iterator>
 #include <memory>
+#include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "platform/preferences/linux/FilePreferences.h"
@@ -82,6 +85,18 @@ struct SystemCalls {
   int failRename = 0;
   int failOpen = 0;         // of existing files, for reading
   int failRenameFlags = 0;  // of renames that must not replace anything
+  int reads = 0;            // calls of pread
+
+  // Runs before each call of "write", "fsync file", "fsync folder", "rename", "flock", "mkdir" and "read",
+  // and after "read" as "have read"; not for the calls that it makes itself.
+  std::function<void(std::string_view call)> hook;
+  std::string machineIdFile;  // stands for /etc/machine-id, unless empty
+
+  // With a time, the steady clock stands still but for the pauses that are asked for, and nobody waits for
+  // them.
+  std::optional<std::chrono::nanoseconds> steadyTime;
+  std::vector<std::chrono::nanoseconds> pauses;
+  std::optional<std::chrono::nanoseconds> wallTime;  // since 1970; stands still
 
   SystemCalls();
   SystemCalls(const SystemCalls&) = delete;
