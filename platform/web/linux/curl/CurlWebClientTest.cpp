@@ -13,6 +13,7 @@
 #include <future>
 #include <optional>
 #include <set>
+#include <stdexcept>
 #include <system_error>
 
 #include "platform/base/fakes/FailingAllocations.h"
@@ -1010,6 +1011,31 @@ TEST_F(CurlWebClientNetworkTest, ThisMachineItselfIsReachedWithoutANetwork) {
   });
   EXPECT_EQ(outcome(server->url("/", "localhost"), false), WebErrorKind::none);
   EXPECT_EQ(outcome(server->url("/", "127.0.0.1"), false), WebErrorKind::none);
+  EXPECT_EQ(arrived(0), 0U);
+}
+
+TEST_F(CurlWebClientNetworkTest, WhatAnEarlierHopTriedOverCellularSaysNothingOfALaterOne) {
+  join("pdp_ip0", 1);
+  // The IPv4 address of "localhost" leads out over cellular, the IPv6 address does not.
+  ASSERT_TRUE(ours.ip("address del 127.0.0.1/8 dev lo") && ours.ip("route add 127.0.0.1/32 dev pdp_ip0"));
+  std::unique_ptr<HttpsServer> server;
+  try {
+    ours.run([&] {
+      server = std::make_unique<HttpsServer>(
+          identity,
+          [](Connection& connection) {
+            connection.readRequest();
+            connection.respond("302 Found\r\nLocation: https://[::1]:1/", "");
+          },
+          HttpsServer::Address::v6);
+    });
+  } catch (const std::runtime_error&) {
+    GTEST_SKIP() << "no IPv6";
+  }
+  EXPECT_EQ(outcome("https://127.0.0.1:1/", false), WebErrorKind::cellularNotAllowed);
+  EXPECT_EQ(outcome(server->url("/", "localhost"), false), WebErrorKind::cannotConnect)
+      << "nobody listens on the way that is open";
+  EXPECT_EQ(server->connections(), 1);
   EXPECT_EQ(arrived(0), 0U);
 }
 
