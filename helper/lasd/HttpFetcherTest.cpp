@@ -271,6 +271,18 @@ TEST_F(HttpFetcherTest, NothingIsWrittenThroughALinkOrIntoAPipe) {
   EXPECT_FALSE(fetcher->uncompressTo(pipe));
 }
 
+TEST_F(HttpFetcherTest, APipeThatSomebodyReadsIsNoOutputFileAndStays) {
+  const auto fetcher = fetched(gzipOf("content"), gzipType);
+  ASSERT_EQ(::mkfifo(path().c_str(), 0600), 0);
+  const UniqueFd reader(::open(path().c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+  ASSERT_TRUE(reader.isValid());
+  EXPECT_FALSE(fetcher->uncompressTo(path()));
+  EXPECT_EQ(log.entries(), Lines{error("Cannot open output file " + path() + ": Invalid argument")});
+  char c = 0;
+  EXPECT_EQ(::read(reader.get(), &c, 1), 0) << "nobody writes";
+  EXPECT_TRUE(std::filesystem::is_fifo(path()));
+}
+
 TEST_F(HttpFetcherTest, ACorruptGzipBodyLeavesNoFile) {
   const std::string good = gzipOf(std::string(500'000, 'x') + "end");
   std::string wrongChecksum = good;

@@ -6,6 +6,7 @@
 
 #include <atomic>
 #include <thread>
+#include <utility>
 
 #include "Helper/Shared/Server/HelperServerUtils.h"
 #include "helper/lasd/DatabaseTypes.h"
@@ -199,6 +200,29 @@ TEST_F(LASDUpdaterTest, ACheckThatIsUnderWayIsToldAndOneWithoutAManifestHasFaile
   web.answer(kManifest, 200, "no manifest");
   check(lte);
   EXPECT_EQ(updater->lastChecks()[0].outcome, Outcome::failed);
+}
+
+TEST_F(LASDUpdaterTest, AShutDownEndsTheQueueAndACheckThatHasNotBegunNeverRuns) {
+  serveAll("1.0");
+  updater->checkForUpdate(server, lte);
+  const std::weak_ptr<ManualWorkQueue> queue = std::exchange(queues.updater, nullptr);
+  ASSERT_FALSE(queue.expired());
+  updater->shutDown();
+  EXPECT_TRUE(queue.expired());
+  EXPECT_TRUE(web.seen().empty());
+  EXPECT_TRUE(updater->lastChecks().empty());
+}
+
+TEST_F(LASDUpdaterTest, BitsOfNoTypeAreNotChecked) {
+  serveManifest({});
+  check(~std::uint32_t{0});
+  EXPECT_EQ(updater->lastChecks().size(), 5U);
+  for (const auto& each : updater->lastChecks()) {
+    EXPECT_NE(each.type, 0);
+    EXPECT_EQ(static_cast<std::uint32_t>(each.type) & ~kAll, 0U);
+  }
+  check(~kAll);
+  EXPECT_EQ(updater->lastChecks().size(), 5U);
 }
 
 TEST_F(LASDUpdaterTest, TheWholeOfACheckIsLoggedInOrder) {

@@ -5,9 +5,12 @@
 #include <dlfcn.h>
 #include <gtest/gtest.h>
 #include <locale.h>
+#include <sys/mman.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <string>
+#include <string_view>
 
 #include "platform/base/fakes/FailingCalls.h"
 
@@ -53,6 +56,13 @@ TEST(VersionTextTest, VersionsCompareByTheTable) {
       {"\xCE\xA3", "\xCF\x83", true},  // Greek sigma
       {"\xEF\xBC\x91", "1", false},    // a full-width one is no ASCII digit
       {"\xF0\x9D\x9F\x8F", "1", false},
+      {"AZ", "az", true},
+      {"@[`{", "`{@[", false},                         // beside the letters
+      {"\xF0\x90\x90\x80", "\xF0\x90\x90\xA8", true},  // Deseret long i
+      {"\xF0\x90\x90\x80", "\xF0\x90\x90\xA9", false},
+      {"\xE0\xB8\x81", "8\x81", false},  // Thai ko kai, and no UTF-8
+      {"\xC0z", "\xC3\xA0z", false},     // Latin-1, and a with grave accent
+      {"\xE1\xBA", "\xE1\xBB", false},
       {"\xC3", "\xC3", true},  // cut characters compare as their bytes
       {"\xC3", "\xC4", false},
       {huge.c_str(), huge.c_str(), true},
@@ -68,6 +78,22 @@ TEST(VersionTextTest, VersionsCompareByTheTable) {
 TEST(VersionTextTest, ANulIsACharacterLikeOthers) {
   EXPECT_FALSE(sameVersion(std::string("1\0a", 3), std::string("1\0b", 3)));
   EXPECT_TRUE(sameVersion(std::string("1\0a", 3), std::string("01\0A", 4)));
+}
+
+TEST(VersionTextTest, NoByteBeyondATextIsRead) {
+  const auto page = static_cast<std::size_t>(::sysconf(_SC_PAGESIZE));
+  void* const pages = ::mmap(nullptr, 2 * page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+  ASSERT_NE(pages, MAP_FAILED);
+  char* const end = static_cast<char*>(pages) + page;
+  ASSERT_EQ(::mprotect(end, page, PROT_NONE), 0);
+  for (const std::string text : {"", "1", "a", "1a", "a1", "\xC3", "\xE1\xBA", "\xF0\x90\x90", "\xC3\xA9"}) {
+    const std::string_view atEnd(end - text.size(), text.size());
+    std::copy(text.begin(), text.end(), end - text.size());
+    EXPECT_TRUE(sameVersion(atEnd, text));
+    EXPECT_FALSE(sameVersion(atEnd, text + "2b"));
+    EXPECT_FALSE(sameVersion(text + "b2", atEnd));
+  }
+  ::munmap(pages, 2 * page);
 }
 
 TEST(VersionTextDeathTest, WithoutTablesOfOtherLettersThoseCompareAsTheyAreUntilThereAreTables) {

@@ -28,6 +28,20 @@ TEST(WebBodyTest, WhatIsAppendedStaysInOrderFromSmallToLarge) {
   }
 }
 
+TEST(WebBodyTest, ABodyThatGrowsInSmallPiecesHasRoomForNoMoreThanTwiceItsBytesAndMovesSeldom) {
+  constexpr std::size_t kLargeUnit = std::size_t{2} << 20;  // a large body has a whole number of them
+  const std::string piece(1000, 'x');
+  WebBody body;
+  int moves = 0;
+  for (std::size_t before = 0; body.size() < 10'000'000; before = body.capacity()) {
+    body.append(bytesOf(body.size() < 1000 ? "x" : piece));
+    if (body.capacity() != before) ++moves;
+    const std::size_t most = 2 * body.size();
+    ASSERT_LE(body.capacity(), most < kLargeUnit ? most : most + kLargeUnit) << body.size();
+  }
+  EXPECT_LE(moves, 25);
+}
+
 TEST(WebBodyTest, ClearingKeepsTheRoom) {
   for (const std::size_t size : {1000U, 5'000'000U}) {
     WebBody body;
@@ -90,6 +104,30 @@ TEST(WebBodyTest, ABodyForAnotherProcessArrivesThereAsItWasWritten) {
   ASSERT_TRUE(arrived);
   EXPECT_TRUE(textOf(*arrived) == "first " + rest);
   EXPECT_GE(arrived->sealedMemory(), 0);
+}
+
+TEST(WebBodyTest, ABodyForAnotherProcessArrivesWhereverItsPiecesAndPagesEnd) {
+  for (const std::size_t size : {1U, 4095U, 4096U, 4097U, 8192U}) {
+    for (const std::size_t first : {std::size_t{1}, size / 2, size - 1, size}) {
+      SCOPED_TRACE(std::to_string(first) + " of " + std::to_string(size));
+      const std::string text = std::string(first, 'a') + std::string(size - first, 'b');
+      WebBody made = WebBody::forAnotherProcess();
+      made.append(bytesOf(text.substr(0, first)));
+      made.append(bytesOf(text.substr(first)));
+      EXPECT_EQ(made.size(), size);
+      const auto arrived = WebBody::ofSealedMemory(made.takeSealed(), size);
+      ASSERT_TRUE(arrived);
+      EXPECT_TRUE(textOf(*arrived) == text);
+    }
+  }
+}
+
+TEST(WebBodyTest, ABodyOfItsOwnHasNoMemoryForAnotherProcess) {
+  WebBody body;
+  body.append(bytesOf("ours"));
+  EXPECT_EQ(body.sealedMemory(), -1);
+  EXPECT_FALSE(body.takeSealed().isValid());
+  EXPECT_EQ(WebBody::forAnotherProcess().sealedMemory(), -1) << "nobody has sealed it yet";
 }
 
 TEST(WebBodyTest, MemoryThatCanStillChangeOrIsOfAnotherSizeIsNoBody) {

@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/base/fakes/FailingMalloc.h"
 #include "platform/gzip/fakes/GzipOf.h"
 
 namespace brenvik {
@@ -39,6 +40,7 @@ class ZlibGunzipTest : public testing::Test {
     output.clear();
     return gunzip.gunzip({reinterpret_cast<const std::byte*>(input.data()), input.size()}, largest,
                          [this](std::span<const std::byte> piece) {
+                           EXPECT_FALSE(piece.empty());
                            if (output.size() + piece.size() > refuseBeyond) return false;
                            output.append(reinterpret_cast<const char*>(piece.data()), piece.size());
                            return true;
@@ -68,6 +70,20 @@ TEST_F(ZlibGunzipTest, EveryShorterLengthIsTruncated) {
   for (std::size_t size = 0; size < whole.size(); ++size) {
     EXPECT_EQ(run(whole.substr(0, size)), size == boundary ? GunzipResult::whole : GunzipResult::truncated)
         << size;
+  }
+}
+
+TEST_F(ZlibGunzipTest, AllThatACutFileHoldsComesOutWhereverThePiecesEnd) {
+  // Every byte in the midst of it stands for the same number of zeros.
+  const std::string zeros = gzipOf(std::string(1'000'000, '\0'));
+  const auto outputOf = [&](std::size_t size) {
+    EXPECT_EQ(run(zeros.substr(0, size)), GunzipResult::truncated) << size;
+    return output.size();
+  };
+  const std::size_t ofOneByte = outputOf(101) - outputOf(100);
+  ASSERT_GT(ofOneByte, 1000U);
+  for (std::size_t size = 100; size < 700; ++size) {
+    EXPECT_EQ(outputOf(size), outputOf(100) + (size - 100) * ofOneByte) << size;
   }
 }
 
@@ -143,6 +159,43 @@ TEST_F(GunzipIntoTest, WhatGoesBeyondTheRoomIsCountedAndNotWritten) {
   EXPECT_EQ(outcome.size, 1'000'000U);
   EXPECT_LE(written().size(), 500'000U);
   EXPECT_EQ(into(gzipOf(text(1'000'000)), 500'000, 999'999).result, GunzipResult::tooLarge);
+}
+
+TEST_F(GunzipIntoTest, WhicheverAllocationFailsItIsALackOfMemoryAndNothingIsCounted) {
+  if (!FailingMalloc::kWork) GTEST_SKIP() << "nothing fails under a sanitizer";
+  const std::string whole = gzipOf(text(1000));
+  long number = 0;
+  for (;; ++number) {
+    SCOPED_TRACE("allocation " + std::to_string(number));
+    GunzipOutcome outcome;
+    bool hasFailed = false;
+    {
+      const FailingMalloc failing(number, FailingMalloc::HowMany::one);
+      outcome = into(whole, kNoLimit);
+      hasFailed = FailingMalloc::failures() > 0;
+    }
+    EXPECT_EQ(outcome.writeError, 0);
+    if (!hasFailed) {
+      EXPECT_EQ(outcome.result, GunzipResult::whole);
+      break;
+    }
+    EXPECT_EQ(outcome.result, GunzipResult::outOfMemory);
+    EXPECT_EQ(outcome.size, 0U);
+    EXPECT_TRUE(written().empty());
+  }
+  EXPECT_GE(number, 2) << "of zlib and our own";
+}
+
+TEST_F(GunzipIntoTest, WhoeverSaysNoAfterAPieceEndsTheWork) {
+  const std::string whole = gzipOf(text(1'000'000));
+  int calls = 0;
+  const auto outcome = gunzip.gunzipInto({std::as_bytes(std::span(whole))}, file.get(), kNoLimit, kNoLimit,
+                                         [&calls] { return ++calls < 2; });
+  EXPECT_EQ(outcome.result, GunzipResult::refused);
+  EXPECT_EQ(outcome.writeError, 0);
+  EXPECT_EQ(calls, 2);
+  EXPECT_EQ(outcome.size, written().size());
+  EXPECT_LT(outcome.size, 1'000'000U);
 }
 
 TEST_F(GunzipIntoTest, AWriteThatFailsEndsTheWorkWithItsError) {

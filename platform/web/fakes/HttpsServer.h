@@ -16,6 +16,7 @@
 #include <chrono>
 #include <cstdint>
 #include <cstdio>
+#include <cstring>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -98,7 +99,7 @@ class Identity {
   OpenSslPointer<X509> certificate_;
 };
 
-// Serves each connection on a thread of its own with a script; listens on a free port of 127.0.0.1.
+// Serves each connection on a thread of its own with a script; listens on a free port of 127.0.0.1 or ::1.
 class HttpsServer {
  public:
   // One connection. Every member may find the client gone; the script then runs to its end without effect.
@@ -161,9 +162,10 @@ class HttpsServer {
   using Script = std::function<void(Connection&)>;
 
   enum class Wire { tls, plain };
+  enum class Address { v4, v6 };
 
-  HttpsServer(const Identity& identity, Script script)
-      : HttpsServer(&identity, std::move(script), Wire::tls) {}
+  HttpsServer(const Identity& identity, Script script, Address address = Address::v4)
+      : HttpsServer(&identity, std::move(script), Wire::tls, address) {}
   // Speaks this version of TLS (TLS1_1_VERSION ...) and no other, however old it is.
   HttpsServer(const Identity& identity, Script script, int onlyVersion)
       : HttpsServer(&identity, std::move(script), Wire::tls) {
@@ -193,23 +195,31 @@ class HttpsServer {
   int connections() const { return connections_; }
 
  private:
-  HttpsServer(const Identity* identity, Script script, Wire wire) : script_(std::move(script)) {
+  HttpsServer(const Identity* identity, Script script, Wire wire, Address address = Address::v4)
+      : script_(std::move(script)) {
     if (wire == Wire::tls) {
       context_.reset(SSL_CTX_new(TLS_server_method()));
       SSL_CTX_use_certificate(context_.get(), identity->certificate());
       SSL_CTX_use_PrivateKey(context_.get(), identity->key());
     }
-    listener_.reset(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_in self{};
-    self.sin_family = AF_INET;
-    self.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t size = sizeof self;
+    const bool isV6 = address == Address::v6;
+    listener_.reset(::socket(isV6 ? AF_INET6 : AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_in6 self{};  // its port stands where that of a sockaddr_in does
+    socklen_t size = isV6 ? sizeof self : sizeof(sockaddr_in);
+    self.sin6_family = AF_INET6;
+    self.sin6_addr = in6addr_loopback;
+    if (!isV6) {
+      sockaddr_in v4{};
+      v4.sin_family = AF_INET;
+      v4.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+      std::memcpy(&self, &v4, sizeof v4);
+    }
     if (::bind(listener_.get(), reinterpret_cast<sockaddr*>(&self), size) != 0 ||
         ::listen(listener_.get(), 64) != 0 ||
         ::getsockname(listener_.get(), reinterpret_cast<sockaddr*>(&self), &size) != 0) {
       throw std::runtime_error("cannot listen");
     }
-    port_ = ntohs(self.sin_port);
+    port_ = ntohs(self.sin6_port);
     acceptor_ = std::thread([this] { acceptAll(); });
   }
   void acceptAll() {

@@ -12,10 +12,14 @@
 #include <fstream>
 #include <future>
 #include <optional>
+#include <set>
+#include <stdexcept>
 #include <system_error>
 
+#include "platform/base/fakes/FailingAllocations.h"
 #include "platform/gzip/fakes/GzipOf.h"
 #include "platform/net/fakes/PrivateNetwork.h"
+#include "platform/runloop/RunAndWait.h"
 #include "platform/runloop/linux/SystemQueues.h"
 #include "platform/web/fakes/HttpsServer.h"
 
@@ -27,17 +31,20 @@ using Connection = HttpsServer::Connection;
 
 const char kLocalNames[] = "DNS:localhost,IP:127.0.0.1";
 
-std::string textOf(const WebResponse& response) {
-  return {reinterpret_cast<const char*>(response.body.data()), response.body.size()};
-}
+std::string textOf(const WebBody& body) { return {reinterpret_cast<const char*>(body.data()), body.size()}; }
+std::string textOf(const WebResponse& response) { return textOf(response.body); }
 
-// A queue of a system that runs short: it works, and refuses to watch sockets or to time as it is told.
+// A queue of a system that runs short: it works, and refuses to watch sockets or to time as it is told. It
+// can also time without leeway, and notes what it watches sockets for.
 class ShortQueue final : public WorkQueue {
  public:
   struct Refusals {
     std::atomic<bool> descriptors{false};
     std::atomic<bool> timers{false};
     std::atomic<bool> tasks{false};
+    std::atomic<bool> leeway{false};
+    std::atomic<bool> singleEvents{false};  // a socket that is ready comes as readable and writable
+    std::array<bool, 4> interests{};        // by Interest; noted on the queue
   };
   ShortQueue(std::shared_ptr<WorkQueue> real, Refusals& refusals)
       : real_(std::move(real)), refusals_(refusals) {}
@@ -52,15 +59,35 @@ class ShortQueue final : public WorkQueue {
   std::unique_ptr<Timer> makeTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
                                    std::chrono::nanoseconds leeway, Task handler) override {
     if (refusals_.timers) return std::make_unique<DeadTimer>();
-    return real_->makeTimer(first, interval, leeway, std::move(handler));
+    return real_->makeTimer(first, interval, refusals_.leeway ? 0ns : leeway, std::move(handler));
   }
   bool isCurrent() const noexcept override { return real_->isCurrent(); }
   std::unique_ptr<DescriptorSource> watchDescriptor(int fd, Interest interest,
                                                     RunLoop::DescriptorHandler handler) override {
-    return refusals_.descriptors ? nullptr : real_->watchDescriptor(fd, interest, std::move(handler));
+    if (refusals_.descriptors) return nullptr;
+    refusals_.interests.at(static_cast<std::size_t>(interest)) = true;
+    auto source = real_->watchDescriptor(fd, interest, [this, handler = std::move(handler)](Readiness ready) {
+      if (refusals_.singleEvents) ready.isReadable = ready.isWritable = true;
+      handler(ready);
+    });
+    return source != nullptr ? std::make_unique<NotedSource>(std::move(source), refusals_) : nullptr;
   }
 
  private:
+  class NotedSource final : public DescriptorSource {
+   public:
+    NotedSource(std::unique_ptr<DescriptorSource> real, Refusals& refusals)
+        : real_(std::move(real)), refusals_(refusals) {}
+    void invalidate() noexcept override { real_->invalidate(); }
+    bool setInterest(Interest interest) noexcept override {
+      refusals_.interests.at(static_cast<std::size_t>(interest)) = true;
+      return real_->setInterest(interest);
+    }
+
+   private:
+    const std::unique_ptr<DescriptorSource> real_;
+    Refusals& refusals_;
+  };
   class DeadTimer final : public Timer {
    public:
     bool activate() override { return false; }
@@ -76,7 +103,8 @@ class ShortQueues final : public WorkQueues {
   WorkQueue& main() noexcept override { return real_.main(); }
   WorkQueue& global() noexcept override { return real_.global(); }
   std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
-    return std::make_shared<ShortQueue>(real_.makeSerial(std::move(label), qualityOfService), refusals);
+    latest = real_.makeSerial(std::move(label), qualityOfService);
+    return std::make_shared<ShortQueue>(latest, refusals);
   }
   std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t startTime,
                                                            WorkQueue::Task onExit,
@@ -84,6 +112,7 @@ class ShortQueues final : public WorkQueues {
     return real_.makeProcessExitSource(pid, startTime, std::move(onExit), std::move(onCancel));
   }
   ShortQueue::Refusals refusals;
+  std::shared_ptr<WorkQueue> latest;  // the real one
 
  private:
   WorkQueues& real_;
@@ -739,7 +768,7 @@ TEST_F(CurlWebClientTest, BodiesForAnotherProcessAreWrittenIntoMemoryThatCanBeSe
   ASSERT_EQ(response->body.size(), body.size());
   const auto read = WebBody::ofSealedMemory(response->body.takeSealed(), body.size());
   ASSERT_TRUE(read);
-  EXPECT_TRUE(std::string(reinterpret_cast<const char*>(read->data()), read->size()) == body);
+  EXPECT_TRUE(textOf(*read) == body);
 }
 
 TEST_F(CurlWebClientTest, WithoutDescriptorsOrTimersToWorkWithRequestsCompleteAndLaterOnesWork) {
@@ -790,9 +819,118 @@ TEST_F(CurlWebClientTest, ARequestNobodyWaitsForIsHarmless) {
     connection.readRequest();
     connection.respond("200 OK", "x");
   });
-  const auto request = client->makeRequest(WebRequestType::get, server.url(), {}, client->makeSession());
-  request->send({});
+  bool isTold = false;
+  enum class Completion { none, empty, whole };
+  for (const auto completion : {Completion::none, Completion::empty, Completion::whole}) {
+    for (const auto& queue : {std::shared_ptr<WorkQueue>(), callbackQueue}) {
+      if (completion == Completion::whole && queue != nullptr) continue;  // that one is told
+      const auto request = client->makeRequest(WebRequestType::get, server.url(), {}, client->makeSession());
+      request->setCallbackQueue(queue);
+      if (completion == Completion::empty) request->setCompletion({});
+      if (completion == Completion::whole)
+        request->setCompletion([&isTold](const std::shared_ptr<WebResponse>&) { isTold = true; });
+      request->send({});
+    }
+  }
   EXPECT_EQ(fetch(server.url())->statusCode, 200);
+  client.reset();
+  runAndWait(*callbackQueue, [] {});
+  EXPECT_FALSE(isTold) << "on no queue";
+}
+
+TEST_F(CurlWebClientTest, WhileTheServerIsSilentASocketIsWatchedForReadingOnly) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.respond("200 OK", "x");
+  });
+  ShortQueues shortQueues(queues);
+  client = CurlWebClient::make(shortQueues, settings);
+  EXPECT_EQ(textOf(*fetch(server.url())), "x");
+  client.reset();
+  const auto& noted = shortQueues.refusals.interests;
+  EXPECT_TRUE(noted[static_cast<std::size_t>(Interest::writing)]) << "to connect";
+  EXPECT_TRUE(noted[static_cast<std::size_t>(Interest::reading)]);
+}
+
+TEST_F(CurlWebClientTest, ASocketThatIsReadableAndWritableAtOnceIsReadAndWritten) {
+  std::promise<std::size_t> seen;
+  HttpsServer server(identity, [&](Connection& connection) {
+    seen.set_value(connection.readRequest().size());
+    connection.respond("200 OK", "x");
+  });
+  ShortQueues shortQueues(queues);
+  shortQueues.refusals.singleEvents = true;
+  client = CurlWebClient::make(shortQueues, settings);
+  Options options;
+  options.headers = {{"X-Long", std::string(100'000, 'x')}};  // more than libcurl sends at once
+  options.timeLimit = 20s;
+  EXPECT_EQ(textOf(*fetch(server.url(), options)), "x");
+  client.reset();
+  EXPECT_GT(seen.get_future().get(), 100'000U);
+}
+
+// libcurl counts whole milliseconds and may find that a time-out which it asked for is not quite due.
+TEST_F(CurlWebClientTest, ATimeOutThatTheTimerTellsToTheNanosecondIsNotLost) {
+  settings.connectLimit = 5ms;
+  HttpsServer server([](Connection& connection) { connection.stall(); }, HttpsServer::Wire::plain);
+  ShortQueues shortQueues(queues);
+  shortQueues.refusals.leeway = true;
+  for (int i = 0; i < 30; ++i) {
+    client = CurlWebClient::make(shortQueues, settings);
+    auto answer = start(server.url("/", "127.0.0.1"), {});
+    const bool isTold = answer.wait_for(20s) == std::future_status::ready;
+    client.reset();
+    ASSERT_TRUE(isTold) << i;
+    expectKind(WebErrorKind::timedOut, answer.get());
+  }
+}
+
+TEST_F(CurlWebClientTest, WhicheverAllocationOfTheClientFailsTheCompletionComesAndNoBodyIsShort) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "nothing fails under this sanitizer";
+  const std::string value = "a value that no string holds by itself";
+  HttpsServer server(identity, [&](Connection& connection) {
+    if (connection.readRequest().starts_with("GET /moved "))
+      return connection.respond("302 Found\r\nLocation: /a/place/with/a/name/of/some/length", "");
+    connection.respond("200 OK\r\nX-Field-With-A-Long-Name: " + value, "x");
+  });
+  settings.bodiesForAnotherProcess = true;
+  std::set<WebErrorKind> kinds;
+  bool hasFailed = true;
+  for (long number = 0; hasFailed; ++number) {
+    SCOPED_TRACE("allocation " + std::to_string(number));
+    ShortQueues shortQueues(queues);
+    client = CurlWebClient::make(shortQueues, settings);
+    std::optional<FailingAllocations> failing;
+    runAndWait(*shortQueues.latest, [&] { failing.emplace(number, FailingAllocations::HowMany::one); });
+    const auto request = client->makeRequest(WebRequestType::get, server.url("/moved"),
+                                             {{"X-Header-With-A-Long-Name", value}}, client->makeSession());
+    auto answer = std::make_shared<std::promise<std::shared_ptr<WebResponse>>>();
+    auto future = answer->get_future();
+    request->setCallbackQueue(callbackQueue);
+    request->setCompletion([promise = std::move(answer)](std::shared_ptr<WebResponse> response) {
+      promise->set_value(std::move(response));
+    });
+    request->send({});
+    const auto response = future.get();  // throws if the completion went away without a call
+    runAndWait(*shortQueues.latest, [&] {
+      hasFailed = FailingAllocations::failures() > 0;
+      failing.reset();
+    });
+    client.reset();
+    kinds.insert(response->errorKind);
+    if (response->errorKind != WebErrorKind::none) {
+      EXPECT_TRUE(hasFailed);
+      EXPECT_TRUE(response->body.empty());
+      continue;
+    }
+    EXPECT_EQ(response->statusCode, 200);
+    EXPECT_EQ(response->headers["X-Field-With-A-Long-Name"], value);
+    const auto read = WebBody::ofSealedMemory(response->body.takeSealed(), 1);
+    ASSERT_TRUE(read);
+    EXPECT_EQ(textOf(*read), "x");
+  }
+  EXPECT_EQ(kinds,
+            (std::set{WebErrorKind::none, WebErrorKind::clientUnavailable, WebErrorKind::outOfMemory}));
 }
 
 // ---- names and cellular, in networks of our own ----
@@ -876,6 +1014,31 @@ TEST_F(CurlWebClientNetworkTest, ThisMachineItselfIsReachedWithoutANetwork) {
   EXPECT_EQ(arrived(0), 0U);
 }
 
+TEST_F(CurlWebClientNetworkTest, WhatAnEarlierHopTriedOverCellularSaysNothingOfALaterOne) {
+  join("pdp_ip0", 1);
+  // The IPv4 address of "localhost" leads out over cellular, the IPv6 address does not.
+  ASSERT_TRUE(ours.ip("address del 127.0.0.1/8 dev lo") && ours.ip("route add 127.0.0.1/32 dev pdp_ip0"));
+  std::unique_ptr<HttpsServer> server;
+  try {
+    ours.run([&] {
+      server = std::make_unique<HttpsServer>(
+          identity,
+          [](Connection& connection) {
+            connection.readRequest();
+            connection.respond("302 Found\r\nLocation: https://[::1]:1/", "");
+          },
+          HttpsServer::Address::v6);
+    });
+  } catch (const std::runtime_error&) {
+    GTEST_SKIP() << "no IPv6";
+  }
+  EXPECT_EQ(outcome("https://127.0.0.1:1/", false), WebErrorKind::cellularNotAllowed);
+  EXPECT_EQ(outcome(server->url("/", "localhost"), false), WebErrorKind::cannotConnect)
+      << "nobody listens on the way that is open";
+  EXPECT_EQ(server->connections(), 1);
+  EXPECT_EQ(arrived(0), 0U);
+}
+
 TEST_F(CurlWebClientNetworkTest, WithoutARouteThereIsNoConnection) {
   EXPECT_EQ(outcome("https://203.0.113.9/", false), WebErrorKind::cannotConnect);
   EXPECT_EQ(outcome("https://203.0.113.9/", true), WebErrorKind::cannotConnect);
@@ -886,7 +1049,8 @@ TEST_F(CurlWebClientNetworkTest, ANameServerThatIsDeadOrOutOfReachDoesNotHoldThe
   const auto unreachable = outcome("https://lasd.example/", false);
   EXPECT_TRUE(unreachable == WebErrorKind::hostNotFound || unreachable == WebErrorKind::timedOut);
   join("wifi0", 2);
-  // Its neighbour never answers, so neither does the name server of this machine's own configuration.
+  // Nobody has the neighbour's address, so the name server of this machine's own configuration never answers.
+  ASSERT_TRUE(ours.ip("neighbour add 10.7.2.9 lladdr 02:00:00:00:00:09 dev wifi0 nud permanent"));
   ASSERT_TRUE(ours.ip("route add default via 10.7.2.9"));
   const auto before = std::chrono::steady_clock::now();
   EXPECT_EQ(outcome("https://lasd.example/", false), WebErrorKind::timedOut);
