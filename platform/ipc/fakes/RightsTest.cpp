@@ -50,6 +50,25 @@ TEST_F(RightsTest, AMovedRightIsDroppedByItsNewOwnerAlone) {
   EXPECT_EQ(ports.failedDrops, 0);
 }
 
+TEST_F(RightsTest, ARightThatIsMovedIntoAnEmptyOneOrOneOfAnotherSpaceIsDroppedInItsOwnSpace) {
+  FakePortSpace others;
+  PortName ofOthers = kNullPort;
+  ASSERT_EQ(others.allocateReceiveRight(&ofOthers), kern::success);
+  ReceiveRight empty;
+  ReceiveRight right(others, ofOthers);
+  empty = ReceiveRight(ports, allocate());
+  right = ReceiveRight(ports, allocate());
+  EXPECT_TRUE(others.receiveRights.empty());
+  EXPECT_EQ(ports.receiveRights.size(), 2U);
+  empty.reset();
+  right.reset();
+  EXPECT_FALSE(empty);
+  EXPECT_EQ(right.name(), kNullPort);
+  EXPECT_TRUE(ports.receiveRights.empty());
+  right.reset();
+  EXPECT_EQ(ports.failedDrops + others.failedDrops, 0);
+}
+
 TEST_F(RightsTest, AReleasedRightStaysAndAnEmptyOneOrADeadNameDropsNothing) {
   const PortName name = allocate();
   { EXPECT_EQ(ReceiveRight(ports, name).release(), name); }

@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <grp.h>
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <poll.h>
 #include <sched.h>
 #include <sys/file.h>
@@ -28,6 +29,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/base/fakes/FailingAllocations.h"
 #include "platform/base/fakes/FailingCalls.h"
 #include "platform/datagram/Datagram.h"
 #include "platform/ipc/linux/BacklogGuess.h"
@@ -35,6 +37,7 @@
 #include "platform/ipc/linux/SystemBootstrap.h"
 #include "platform/ipc/linux/SystemPortSources.h"
 #include "platform/log/fakes/RecordingLog.h"
+#include "platform/runloop/fakes/ManualRunLoop.h"
 #include "platform/runloop/linux/SystemQueues.h"
 
 namespace brenvik {
@@ -47,6 +50,9 @@ std::function<void()> beforeLocking;  // what happens before a file is locked
 // How far the clock goes with each look at it; negative: it is the system's.
 constinit std::chrono::nanoseconds clockStep{-1};
 constinit std::chrono::nanoseconds steppedTime{};
+
+constinit thread_local int pauses = 0;          // of this thread
+constinit thread_local int looksAtSockets = 0;  // by this thread
 
 }  // namespace
 }  // namespace brenvik
@@ -62,6 +68,16 @@ extern "C" int clock_gettime(clockid_t clock, timespec* time) noexcept {
   steppedTime += clockStep;
   *time = {steppedTime.count() / 1'000'000'000, steppedTime.count() % 1'000'000'000};
   return 0;
+}
+
+extern "C" int nanosleep(const timespec* time, timespec* left) {
+  ++brenvik::pauses;
+  return static_cast<int>(::syscall(SYS_nanosleep, time, left));
+}
+
+extern "C" ssize_t recvmsg(int fd, msghdr* message, int flags) {
+  ++brenvik::looksAtSockets;
+  return ::syscall(SYS_recvmsg, fd, message, flags);
 }
 
 extern "C" ssize_t send(int fd, const void* bytes, size_t size, int flags) {
@@ -138,6 +154,7 @@ class TestTable final : public RoutineTable {
   PortName given = 0;
   KernelReturn refuseWith = kern::failure;
   std::function<void()> whileServing;
+  std::function<void(void*, std::uint32_t)> whenAllocated;  // a region of a reply
 
  private:
   static Outcome handle(void* context, const Request& request, Reply& reply) {
@@ -170,6 +187,7 @@ class TestTable final : public RoutineTable {
         void* address = nullptr;
         if (self.regions_.allocate(&address, length) != kern::success) break;
         std::fill_n(static_cast<char*>(address), length, 'r');
+        if (self.whenAllocated) self.whenAllocated(address, length);
         auto& out = reply.as<OutOfLineReply>();
         out.header.bits = kReplyDisposition | kComplexBit;
         out.header.size = sizeof out;
@@ -607,6 +625,18 @@ TEST_F(PortsTest, ACheckInReplyCarriesACopyOfTheSendRight) {
   EXPECT_EQ(table.arrivedOn, other);
 }
 
+TEST_F(PortsTest, ACheckInWhoseRightIsNotThereIsAnsweredWith6AndThatAlone) {
+  table.given = 0x4242;
+  const auto answer = exchange(message(kGiveRight, 18, 24, 0xABCD));
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->code(), kern::resourceShortage);
+  EXPECT_TRUE(answer->fds.empty());
+  EXPECT_EQ(answer->header().bits, 18U);
+  EXPECT_EQ(answer->header().size, 36U);
+  EXPECT_EQ(answer->header().localPort, 0xABCDU);
+  EXPECT_EQ(answer->header().id, kGiveRight + 100);
+}
+
 // ---- regions of replies ----
 
 TEST_F(PortsTest, ARegionThatFitsTheDatagramTravelsInLineAndALargerOneAsASealedMemfd) {
@@ -633,6 +663,20 @@ TEST_F(PortsTest, ARegionThatFitsTheDatagramTravelsInLineAndALargerOneAsASealedM
     }
     EXPECT_EQ(regions.live(), 0U);
   }
+}
+
+TEST_F(PortsTest, ARegionThatCannotBeSealedIsNotSentAndNothingOfItIsLeft) {
+  void* twin = nullptr;
+  // The kernel seals nothing that can be written through another mapping.
+  table.whenAllocated = [&](void* address, std::uint32_t length) {
+    twin = ::mremap(address, 0, length, MREMAP_MAYMOVE);
+    ASSERT_NE(twin, MAP_FAILED);
+  };
+  const std::size_t before = openDescriptors();
+  EXPECT_EQ(codeOf(message(kRegion).add(kNdrRecord).add(100000U)), kern::resourceShortage);
+  EXPECT_EQ(openDescriptors(), before);
+  EXPECT_EQ(regions.live(), 0U);
+  ::munmap(twin, 100000);
 }
 
 TEST_F(PortsTest, AnEmptyRegionHasAddressAndSizeZero) {
@@ -702,6 +746,210 @@ TEST_F(PortsTest, AReplyForWhichTheKernelNeverHasMemoryEndsItsChannelAfterASecon
   EXPECT_EQ(regions.live(), 1U);
   while (regions.live() > 0) ASSERT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);
   EXPECT_EQ(noMemory.failures(), 1 + 100);
+}
+
+// A client whose channel is served by a loop that the test plays.
+class PlayedLoopTest : public PortsTest {
+ protected:
+  static constexpr auto kReadable = Readiness{.isReadable = true};
+  static constexpr auto kWritable = Readiness{.isWritable = true};
+
+  void SetUp() override { ASSERT_NO_FATAL_FAILURE(addClient()); }
+  // Another one, in the place of the one before.
+  void addClient() {
+    ASSERT_EQ(ports.allocateReceiveRight(&port), kern::success);
+    ASSERT_EQ(ports.insertSendRight(port), kern::success);
+    fd = ports.receiveEnd(port)->get();
+    client = UniqueFd(::fcntl(ports.sendEnd(port)->get(), F_DUPFD_CLOEXEC, 0));
+    served = sources.makeRoutineSource(port, table, WantTrailer::no);
+    ASSERT_TRUE(served->addTo(played));
+  }
+  void askForRegion() { ASSERT_TRUE(sendTo(client.get(), message(kRegion).add(kNdrRecord).add(1000U))); }
+  // Until no reply fits any more.
+  void fillChannel() const {
+    const std::array<char, 4096> bytes{};
+    while (::sendto(fd, bytes.data(), bytes.size(), MSG_DONTWAIT, nullptr, 0) > 0) {
+    }
+  }
+  // The answer behind what filled the channel.
+  std::optional<Answer> takeAnswer() const {
+    std::optional<Answer> answer;
+    do {
+      answer = receiveFrom(client.get());
+    } while (answer && answer->bytes.size() == 4096);
+    return answer;
+  }
+  bool hasEnded() const { return !played.interestIn(fd); }
+
+  ManualClock clock;
+  ManualRunLoop played{clock};
+  std::shared_ptr<RoutineSource> served;
+  int fd = -1;
+};
+
+TEST_F(PlayedLoopTest, AReplyWaitsForMemoryWithATimerAndForRoomWithoutOneWhicheverItNeedsFirst) {
+  for (const bool needsMemoryFirst : {true, false}) {
+    if (!needsMemoryFirst) fillChannel();
+    askForRegion();
+    if (needsMemoryFirst) {
+      const FailingCall noMemory("send", ENOMEM);
+      played.makeReady(fd, kReadable);
+      EXPECT_EQ(played.timers(), 1U);
+      EXPECT_EQ(played.interestIn(fd), Interest::none);
+      fillChannel();
+    }
+    for (int look = 0; look < 2; ++look) {
+      if (needsMemoryFirst && look == 0) {
+        clock.advance(10ms);
+      } else {
+        played.makeReady(fd, look == 0 ? kReadable : kWritable);
+      }
+      EXPECT_EQ(played.timers(), 0U);
+      EXPECT_EQ(played.interestIn(fd), Interest::writing);
+      EXPECT_EQ(regions.live(), 1U);
+    }
+    EXPECT_FALSE(takeAnswer());
+    for (int look = 0; look < 2 && !needsMemoryFirst; ++look) {
+      const FailingCall noMemory("send", ENOBUFS);
+      played.makeReady(fd, kWritable);
+      EXPECT_EQ(played.timers(), 1U);
+      EXPECT_EQ(played.interestIn(fd), Interest::none);
+    }
+    needsMemoryFirst ? void(played.makeReady(fd, kWritable)) : clock.advance(10ms);
+    EXPECT_EQ(played.timers(), 0U);
+    EXPECT_EQ(played.interestIn(fd), Interest::reading);
+    EXPECT_EQ(regions.live(), 0U);
+    const auto answer = takeAnswer();
+    ASSERT_TRUE(answer);
+    EXPECT_EQ(answer->bytes.size(), 56U + 1000U);
+  }
+}
+
+TEST_F(PlayedLoopTest, AReplyThatCannotBeSentEndsItsChannelAndNothingOfItIsLeft) {
+  for (const int error : {EPIPE, ECONNRESET, ETOOMANYREFS}) {
+    askForRegion();
+    const FailingCall failing("send", error, 0, FailingCall::HowOften::always);
+    played.makeReady(fd, kReadable);
+    EXPECT_EQ(failing.failures(), 1);
+    EXPECT_TRUE(hasEnded()) << error;
+    EXPECT_EQ(regions.live(), 0U);
+    EXPECT_EQ(played.timers(), 0U);
+    EXPECT_FALSE(receiveFrom(client.get()));
+    ASSERT_NO_FATAL_FAILURE(addClient());
+  }
+}
+
+TEST_F(PlayedLoopTest, AReplyThatWaitedAndCannotBeSentThenEndsItsChannel) {
+  for (const bool waitsForMemory : {true, false}) {
+    if (!waitsForMemory) fillChannel();
+    askForRegion();
+    {
+      const FailingCall noMemory("send", waitsForMemory ? ENOMEM : EAGAIN);
+      played.makeReady(fd, kReadable);
+    }
+    EXPECT_EQ(regions.live(), 1U);
+    const FailingCall failing("send", EPIPE);
+    waitsForMemory ? clock.advance(10ms) : void(played.makeReady(fd, kWritable));
+    EXPECT_EQ(failing.failures(), 1);
+    EXPECT_TRUE(hasEnded());
+    EXPECT_EQ(regions.live(), 0U);
+    EXPECT_EQ(played.timers(), 0U);
+    ASSERT_NO_FATAL_FAILURE(addClient());
+  }
+}
+
+TEST_F(PlayedLoopTest, AReplyDoesNotWaitForAClientThatHasGone) {
+  for (const auto gone : {Readiness{.hasHungUp = true}, Readiness{.hasFailed = true}}) {
+    for (const int error : {EAGAIN, ENOMEM}) {
+      askForRegion();
+      const FailingCall failing("send", error, 0, FailingCall::HowOften::always);
+      played.makeReady(fd, kReadable);
+      EXPECT_EQ(regions.live(), 1U);
+      EXPECT_FALSE(hasEnded());
+      played.makeReady(fd, gone);
+      EXPECT_TRUE(hasEnded()) << error;
+      EXPECT_EQ(regions.live(), 0U);
+      EXPECT_EQ(played.timers(), 0U);
+      ASSERT_NO_FATAL_FAILURE(addClient());
+    }
+  }
+}
+
+TEST_F(PlayedLoopTest, AReplyThatNothingCouldTryAgainEndsItsChannelAtOnceOrWhenThatShows) {
+  for (const bool isSeenLater : {false, true}) {
+    played.refuseTimers = !isSeenLater;
+    played.failTimersLater = isSeenLater;
+    askForRegion();
+    const FailingCall noMemory("send", ENOMEM);
+    played.makeReady(fd, kReadable);
+    EXPECT_EQ(hasEnded(), !isSeenLater);
+    EXPECT_EQ(regions.live(), isSeenLater ? 1U : 0U);
+    clock.advance(0ms);
+    EXPECT_TRUE(hasEnded());
+    EXPECT_EQ(regions.live(), 0U);
+    ASSERT_NO_FATAL_FAILURE(addClient());
+  }
+}
+
+TEST_F(PlayedLoopTest, WithoutMemoryForAReplyToWaitInItsChannelEndsAndNothingOfItIsLeft) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "operator new belongs to the sanitizer";
+  for (const int error : {EAGAIN, ENOMEM}) {
+    int ended = 0;
+    for (long first = 0;; ++first) {
+      askForRegion();
+      long failures = 0;
+      {
+        const FailingCall failing("send", error);
+        const FailingAllocations noMemory(first, FailingAllocations::HowMany::one);
+        played.makeReady(fd, kReadable);
+        failures = FailingAllocations::failures();
+      }
+      const bool waits = error == EAGAIN ? played.interestIn(fd) == Interest::writing
+                                         : played.interestIn(fd) == Interest::none && played.timers() == 1;
+      if (waits) {
+        error == EAGAIN ? void(played.makeReady(fd, kWritable)) : clock.advance(10ms);
+        EXPECT_TRUE(receiveFrom(client.get())) << first;
+      } else {
+        ++ended;
+        EXPECT_TRUE(hasEnded()) << first;
+        EXPECT_FALSE(receiveFrom(client.get())) << first;
+      }
+      EXPECT_EQ(regions.live(), 0U) << first;
+      EXPECT_EQ(played.timers(), 0U) << first;
+      if (failures == 0) break;
+      ASSERT_NO_FATAL_FAILURE(addClient());
+    }
+    EXPECT_GE(ended, 1) << error;
+  }
+}
+
+TEST_F(PlayedLoopTest, AChannelThatIsOverEndsOnceNothingIsLeftToRead) {
+  for (const auto gone : {Readiness{.hasHungUp = true}, Readiness{.hasFailed = true}}) {
+    ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
+    table.served = 0;
+    auto readable = gone;
+    readable.isReadable = true;
+    played.makeReady(fd, readable);
+    EXPECT_EQ(table.served, 1) << "what it sent before is served";
+    EXPECT_FALSE(hasEnded());
+    played.makeReady(fd, gone);
+    EXPECT_TRUE(hasEnded());
+    EXPECT_FALSE(served->addTo(played)) << "there is nothing left to serve";
+    ASSERT_NO_FATAL_FAILURE(addClient());
+  }
+}
+
+TEST_F(PlayedLoopTest, ALookThatFindsNothingIsTheLastOfItsTurn) {
+  const auto looksOfATurn = [&] {
+    const int before = looksAtSockets;
+    played.makeReady(fd, kReadable);
+    return looksAtSockets - before;
+  };
+  EXPECT_EQ(looksOfATurn(), 1);
+  ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
+  EXPECT_EQ(looksOfATurn(), 1) << "who waits for an answer has sent no more";
+  ASSERT_TRUE(sendTo(client.get(), message(kEcho, 0, 24, 0)));
+  EXPECT_EQ(looksOfATurn(), 2) << "who waits for none may have";
 }
 
 TEST_F(PortsTest, InvalidatingASourceReleasesTheReplyThatWaited) {
@@ -790,13 +1038,30 @@ TEST_F(BusyClientTest, ItsRequestsCostAnotherClientNoMoreThanABudget) {
 TEST_F(BusyClientTest, RequestsThatTakeLongCostAnotherClientOneOfThem) {
   clockStep = 0ns;
   ASSERT_LE(turnsForRequestsThatWait(), 32);
-  table.whileServing = [] { steppedTime += 30ms; };
+  table.whileServing = [] { steppedTime += 20ms; };
   for (int i = 0; i < 2 * 8 + 1; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
   for (int turn = 0; turn < 2 * 8 + 1; ++turn) {
     const int served = table.served;
     loop->run(0s, ReturnAfterSource::yes);
     EXPECT_EQ(table.served, served + 1) << turn;
   }
+}
+
+TEST_F(BusyClientTest, ATurnEndsAfter20MillisecondsAndNotBefore) {
+  clockStep = 0ns;
+  ASSERT_LE(turnsForRequestsThatWait(), 32);
+  for (int i = 0; i < 8 + 3; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
+  int served = 0;
+  do {  // one of its turns is timed
+    served = table.served;
+    loop->run(0s, ReturnAfterSource::yes);
+  } while (table.served == served + 1 && served < kRequests + 8);
+  for (int i = 0; i < 16; ++i) ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
+  served = table.served;
+  int asked = 0;
+  table.whileServing = [&] { steppedTime += ++asked == 1 ? 20ms - 1ns : 1ns; };
+  loop->run(0s, ReturnAfterSource::yes);
+  EXPECT_EQ(table.served, served + 2);
 }
 
 TEST_F(BusyClientTest, OneWayRequestsThatTakeLongCostAnotherClientTwoOfThem) {
@@ -1021,11 +1286,13 @@ TEST_F(ServiceTest, AStaleSocketFileIsReplaced) {
 
 TEST_F(ServiceTest, ANameThatALiveProcessHoldsIsRefusedAndSaidWhy) {
   listen();
+  pauses = 0;
   PortName second = kNullPort;
   EXPECT_EQ(bootstrap().checkIn("service", &second), kern::noAccess);
   EXPECT_EQ(second, kNullPort);
   EXPECT_EQ(log.entries().back(),
             RecordingLog::unifiedLine(LogLevel::error, "another process already serves " + path()));
+  EXPECT_EQ(pauses, 0) << "who is alive need not be waited for";
   EXPECT_TRUE(connect().isValid()) << "the first is not disturbed";
 }
 
@@ -1306,6 +1573,40 @@ TEST_F(ServiceTest, ConnectionsThatNeverCheckInAreLimitedAndTheOldestGoesFirst) 
   EXPECT_TRUE(receiveFrom(connections.back().get()));
 }
 
+TEST_F(ServiceTest, WhoHasGoneWithoutCheckingInIsNotCounted) {
+  listen();
+  const UniqueFd first = connect();
+  pump();
+  for (int i = 0; i < 100; ++i) {
+    (void)connect();
+    pump();
+  }
+  EXPECT_FALSE(isClosed(first));
+}
+
+TEST_F(ServiceTest, ARoutineMayInvalidateTheServiceThatCalledIt) {
+  listen();
+  const UniqueFd connection = connect();
+  const UniqueFd another = connect();
+  auto [kept, sent] = pair();
+  Datagram checkIn = complexMessage(kKeepRight, 1, 40).add(right());
+  checkIn.fds = {sent.get()};
+  ASSERT_TRUE(sendTo(connection.get(), checkIn));
+  sent.reset();
+  table.whileServing = [&] { serviceSource->invalidate(); };
+  pump();
+  EXPECT_EQ(table.served, 1);
+  EXPECT_FALSE(receiveFrom(connection.get()));
+  EXPECT_TRUE(isClosed(connection));
+  ASSERT_TRUE(sendTo(another.get(), message(kEcho)));
+  pump();
+  EXPECT_EQ(table.served, 1) << "nobody else is served";
+  ASSERT_EQ(ports.deallocateSendRight(table.names.at(0)), kern::success) << "the routine had taken it over";
+  ports.closing().drain();
+  pollfd hungUp{kept.get(), POLLIN, 0};
+  EXPECT_EQ(::poll(&hungUp, 1, 0), 1) << "none is left";
+}
+
 TEST_F(ServiceTest, AnAdmittedConnectionIsNotGivenUpForOthers) {
   listen();
   const UniqueFd admitted = connect();
@@ -1401,6 +1702,57 @@ TEST_F(ServiceTest, WithoutDescriptorsAConnectionIsKeptUntilItsCheckInComes) {
   EXPECT_EQ(answer->code(), kern::resourceShortage);
 }
 
+TEST_F(ServiceTest, WithoutADescriptorForWhoeverWaitsNobodySpinsAndItIsLetInLater) {
+  ASSERT_EQ(bootstrap().checkIn("service", &service), kern::success);
+  serviceSource = sources.makeRoutineSource(service, table, WantTrailer::yes);
+  const UniqueFd connection = connect();
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  // The loop's first timer takes a descriptor.
+  ASSERT_NE(loop->addTimer(
+                1h, 0s, [] {}, [] {}),
+            nullptr);
+  DescriptorShortage shortage(0);
+  ASSERT_TRUE(serviceSource->addTo(*loop)) << "even without a reserve";
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::handledSource);
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::timedOut) << "it waits, and wakes nobody";
+  EXPECT_EQ(table.served, 0);
+  shortage.giveBack(16);
+  EXPECT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);  // looks again
+  const auto answer = receiveFrom(connection.get());
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->code(), 0);
+  const UniqueFd next = connect();
+  ASSERT_TRUE(sendTo(next.get(), message(kEcho)));
+  EXPECT_EQ(loop->run(0s, ReturnAfterSource::yes), RunResult::handledSource);
+  EXPECT_TRUE(receiveFrom(next.get())) << "the next one does not wait";
+}
+
+TEST_F(ServiceTest, TheLineThatSaysThatDescriptorsAreShortFindsOne) {
+  class OpeningLog final : public LogSink {
+   public:
+    OpeningLog() : before_(setLogSink(this)) {}
+    ~OpeningLog() override { setLogSink(before_); }
+    void unified(LogLevel, std::string_view, const LogPlace&, const MessageId&) noexcept override {
+      opened.push_back(UniqueFd(::open("/", O_PATH | O_CLOEXEC)).isValid());
+    }
+    void bsd(SyslogPriority, std::string_view, const MessageId&) noexcept override {}
+    std::vector<bool> opened;
+
+   private:
+    LogSink* const before_;
+  };
+  listen();
+  const UniqueFd connection = connect();
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  const OpeningLog openingLog;
+  const DescriptorShortage shortage(0);
+  pump();
+  const auto answer = receiveFrom(connection.get());
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->code(), kern::resourceShortage);
+  EXPECT_EQ(openingLog.opened, std::vector{true});
+}
+
 TEST_F(ServiceTest, WhoeverIsServedFindsDescriptorsForALook) {
   listen();
   const UniqueFd connection = connect();
@@ -1488,6 +1840,54 @@ TEST_F(ServiceTest, AMessageWithMoreThanOneDescriptorIsAnsweredAndDroppedElsewhe
   ports.closing().drain();
   pollfd hungUp{kept.get(), POLLIN, 0};
   EXPECT_EQ(::poll(&hungUp, 1, 0), 1) << "none is kept";
+}
+
+// The system's loop, which cannot watch what the closing line has to tell.
+class DeafLoop final : public RunLoop {
+ public:
+  DeafLoop(RunLoop& loop, SystemPortSpace& ports) noexcept : loop_(loop), ports_(ports) {}
+  RunResult run(std::chrono::duration<double> timeOut, ReturnAfterSource returnAfterSource) override {
+    return loop_.run(timeOut, returnAfterSource);
+  }
+  void stop() noexcept override { loop_.stop(); }
+  std::unique_ptr<DescriptorSource> addDescriptor(int fd, Interest interest,
+                                                  DescriptorHandler handler) override {
+    if (fd == ports_.closing().readable()) return nullptr;
+    return loop_.addDescriptor(fd, interest, std::move(handler));
+  }
+  std::unique_ptr<LoopSource> addTimer(std::chrono::nanoseconds first, std::chrono::nanoseconds interval,
+                                       std::function<void()> handler, std::function<void()> failed) override {
+    return loop_.addTimer(first, interval, std::move(handler), std::move(failed));
+  }
+
+ private:
+  RunLoop& loop_;
+  SystemPortSpace& ports_;
+};
+
+TEST_F(ServiceTest, AConnectionWhoseMessageNobodyWouldTellIsDroppedEndsAndNothingOfItIsLeft) {
+  ASSERT_EQ(bootstrap().checkIn("service", &service), kern::success);
+  serviceSource = sources.makeRoutineSource(service, table, WantTrailer::yes);
+  DeafLoop deaf(*loop, ports);
+  ASSERT_TRUE(serviceSource->addTo(deaf));
+  Datagram request = complexMessage(kKeepRight, 1, 40).add(right());
+  request.fds.assign(2, client.get());
+  const auto sendOne = [&] {
+    const UniqueFd connection = connect();
+    ASSERT_TRUE(sendTo(connection.get(), request));
+    pump();
+    const auto answer = receiveFrom(connection.get());
+    ASSERT_TRUE(answer);
+    EXPECT_EQ(answer->code(), -304);
+    ports.closing().drain();
+    EXPECT_TRUE(isClosed(connection));
+  };
+  for (int i = 0; i < 8; ++i) sendOne();  // whatever is made once
+  const std::size_t open = openDescriptors();
+  const std::size_t before = ::mallinfo2().uordblks;  // nothing, where a sanitizer has its own memory
+  for (int i = 0; i < 200; ++i) sendOne();
+  EXPECT_EQ(openDescriptors(), open);
+  EXPECT_LT(::mallinfo2().uordblks, before + 200 * std::size_t{64});
 }
 
 TEST_F(ServiceTest, AnAccountThatIsRefusedTooOftenWaitsAndIsThenAnswered) {
