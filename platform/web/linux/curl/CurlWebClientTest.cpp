@@ -229,6 +229,66 @@ TEST_F(CurlWebClientTest, TheRequestCarriesItsHeadersAndNothingOfOurOwnInvention
   EXPECT_EQ(request.find("Evil"), std::string::npos);
 }
 
+TEST_F(CurlWebClientTest, AHeaderThatWouldBreakTheRequestsLinesIsLeftOut) {
+  std::promise<std::string> seen;
+  HttpsServer server(identity, [&](Connection& connection) {
+    seen.set_value(connection.readRequest());
+    connection.respond("200 OK", "x");
+  });
+  const auto with = [](char c) { return std::string("a") + c + "Injected: yes"; };
+  Options options;
+  options.headers = {{"Return", with('\r')}, {"Feed", with('\n')}, {"Nul", with('\0')}, {with('\r'), "name"},
+                     {with('\n'), "name"},   {with('\0'), "name"}, {"", "nameless"},    {"Good", "good"}};
+  expectKind(WebErrorKind::none, fetch(server.url(), options));
+  const std::string request = seen.get_future().get();
+  EXPECT_NE(request.find("\r\nGood: good\r\n"), std::string::npos);
+  for (const char* text : {"Return", "Feed", "Nul", "Injected", "name", "\r\na", "\r\n:"})
+    EXPECT_EQ(request.find(text), std::string::npos) << text << " in " << request;
+}
+
+TEST_F(CurlWebClientTest, AProxyOfTheEnvironmentIsNotUsed) {
+  HttpsServer server(identity, [](Connection& connection) {
+    connection.readRequest();
+    connection.respond("200 OK", "x");
+  });
+  HttpsServer proxy([](Connection&) {}, HttpsServer::Wire::plain);
+  const std::string url = "http://127.0.0.1:" + std::to_string(proxy.port()) + "/";
+  for (const char* name : {"https_proxy", "ALL_PROXY"}) ASSERT_EQ(::setenv(name, url.c_str(), 1), 0);
+  expectKind(WebErrorKind::none, fetch(server.url()));
+  client.reset();
+  for (const char* name : {"https_proxy", "ALL_PROXY"}) ::unsetenv(name);
+  EXPECT_EQ(proxy.connections(), 0);
+}
+
+TEST_F(CurlWebClientTest, AConnectionServesOneRequestAndEndsWithIt) {
+  std::promise<std::string> afterwards;
+  HttpsServer server(identity, [&](Connection& connection) {
+    const bool isFirst = connection.readRequest().starts_with("GET /first ");
+    connection.respond("200 OK", "x");
+    const std::string next = connection.readRequest();
+    if (isFirst) afterwards.set_value(next);
+  });
+  expectKind(WebErrorKind::none, fetch(server.url("/first")));
+  auto next = afterwards.get_future();
+  const bool hasEnded = next.wait_for(20s) == std::future_status::ready;
+  EXPECT_TRUE(hasEnded) << "and not with the client";
+  expectKind(WebErrorKind::none, fetch(server.url("/second")));
+  client.reset();
+  EXPECT_EQ(next.get(), "");
+  EXPECT_EQ(server.connections(), 2);
+}
+
+TEST_F(CurlWebClientTest, WithoutAuthoritiesNoServerIsTrusted) {
+  HttpsServer server(identity, [](Connection& connection) { connection.respond("200 OK", "secret"); });
+  std::ofstream(folder / "empty.pem").flush();
+  for (const char* file : {"missing.pem", "empty.pem"}) {
+    SCOPED_TRACE(file);
+    client.reset();
+    settings.certificateAuthorities = folder / file;
+    expectKind(WebErrorKind::certificateRefused, fetch(server.url()));
+  }
+}
+
 TEST_F(CurlWebClientTest, WithoutAUserAgentNoneIsSent) {
   std::promise<std::string> seen;
   HttpsServer server(identity, [&](Connection& connection) {
@@ -985,6 +1045,22 @@ TEST_F(CurlWebClientNetworkTest, WhereOnlyCellularLeadsOutNothingLeavesLookUpsIn
   EXPECT_EQ(arrived(0), 0U);
   EXPECT_EQ(outcome("https://10.7.1.2/", true), WebErrorKind::cannotConnect) << "allowed, and nobody listens";
   EXPECT_GE(arrived(0, 1), 1U);
+}
+
+TEST_F(CurlWebClientNetworkTest, ANameThatARedirectLeadsToIsNotLookedUpOverCellularEither) {
+  join("pdp_ip0", 1);
+  ASSERT_TRUE(ours.ip("route add default via 10.7.1.2"));
+  settings.connectLimit = 2s;
+  std::unique_ptr<HttpsServer> server;
+  ours.run([&] {
+    server = std::make_unique<HttpsServer>(identity, [](Connection& connection) {
+      connection.readRequest();
+      connection.respond("302 Found\r\nLocation: https://lasd.example/", "");
+    });
+  });
+  EXPECT_EQ(outcome(server->url(), false), WebErrorKind::cellularNotAllowed);
+  EXPECT_EQ(server->connections(), 1);
+  EXPECT_EQ(arrived(0), 0U);
 }
 
 TEST_F(CurlWebClientNetworkTest, WithAnotherWayTheConnectionTakesItAndCellularStaysSilent) {
