@@ -16,6 +16,7 @@
 #include <map>
 #include <mutex>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "platform/base/ProcessFacts.h"
@@ -357,11 +358,16 @@ class LateActivation final : public WorkQueues {
   WorkQueue& main() noexcept override { std::abort(); }
   WorkQueue& global() noexcept override { std::abort(); }
   std::shared_ptr<WorkQueue> makeSerial(std::string, QualityOfService) override { std::abort(); }
-  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t, std::uint32_t, WorkQueue::Task,
+  std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t pid, std::uint32_t startTime,
+                                                           WorkQueue::Task whenItExits,
                                                            WorkQueue::Task) override {
+    watched.emplace_back(pid, startTime);
+    onExit = std::move(whenItExits);
     return std::make_unique<Source>(*this);
   }
 
+  std::vector<std::pair<pid_t, std::uint32_t>> watched;  // with the start time
+  WorkQueue::Task onExit;                                // of the latest
   std::function<void()> beforeActivation;
   int activations = 0;
   int activationsInVain = 0;  // of a watcher that was cancelled before
@@ -391,6 +397,28 @@ TEST_F(EntitlementCheckTest, AWatcherThatIsActivatedAfterTheTeardownWasCancelled
   EXPECT_TRUE(asked.HasEntitlement(kName, caller));
   EXPECT_EQ(late.activations, 1);
   EXPECT_EQ(late.activationsInVain, 1);
+}
+
+TEST_F(EntitlementCheckTest, AWatcherThatIsActivatedAfterItsProcesssExitWasHandledWasCancelled) {
+  LateActivation late;
+  EntitlementCheck asked(security, late);
+  security.grant(caller, kName, PropertyList::boolean(true));
+  late.beforeActivation = [&] { late.onExit(); };
+  EXPECT_TRUE(asked.HasEntitlement(kName, caller));
+  EXPECT_EQ(late.activations, 1);
+  EXPECT_EQ(late.activationsInVain, 1);
+  EXPECT_EQ(asked.grants(), 0U);
+}
+
+TEST_F(EntitlementCheckTest, TheProcessThatIsWatchedIsTheOneThatStartedWhenTheCallerDid) {
+  LateActivation late;
+  EntitlementCheck asked(security, late);
+  const AuditToken later = tokenOf(7, 200);
+  security.grant(later, kName, PropertyList::boolean(true));
+  EXPECT_TRUE(asked.HasEntitlement(kName, later));
+  EXPECT_EQ(late.watched, (std::vector<std::pair<pid_t, std::uint32_t>>{{7, 200}}));
+  EXPECT_EQ(late.activations, 1);
+  EXPECT_EQ(late.activationsInVain, 0);
 }
 
 TEST_F(EntitlementCheckTest, AnExitHandledAfterTheTeardownFindsNothingToDo) {

@@ -105,11 +105,12 @@ TEST_F(RefusalLogTest, AtTheEndTheNumbersThatWereNotToldAre) {
 }
 
 TEST_F(RefusalLogTest, AtTheEndOnlyNumbersThatWereNotToldAreAndEverybodyIsForgotten) {
+  constexpr std::size_t kRemembered = 64;
   const auto refuseAsManyAsAreRememberedAndOneMore = [&] {
-    for (std::size_t i = 0; i <= RefusalLog::kMaxCallers; ++i) {
+    for (std::size_t i = 0; i <= kRemembered; ++i) {
       refuse({7, static_cast<uid_t>(i), "/x", ""});
     }
-    EXPECT_EQ(log.entries().size(), RefusalLog::kMaxCallers + 1) << "each is told, the further one, too";
+    EXPECT_EQ(log.entries().size(), kRemembered + 1) << "each is told, the further one, too";
     log.clear();
   };
   refuseAsManyAsAreRememberedAndOneMore();
@@ -177,6 +178,22 @@ TEST_F(RefusalLogTest, OneFurtherCallerIsToldInTimeAndNoneIsNot) {
   refuseAllThatAreRemembered();
   refuse(stranger(2003));
   EXPECT_EQ(log.entries().size(), 1U) << "the refusal itself";
+}
+
+TEST_F(RefusalLogTest, TheFirst255BytesOfAPathTellOneExecutableFromAnother) {
+  const std::string path = "/" + std::string(253, 'x');
+  refuse({7, 501, path + "a", ""});
+  refuse({7, 501, path + "b", ""});
+  EXPECT_EQ(log.entries().size(), 2U);
+  refuse({7, 501, path + "aa", ""});
+  refuse({7, 501, path + "ab", ""});
+  refuse({7, 501, path + "b" + std::string(1000, 'x'), ""});
+  EXPECT_EQ(log.entries().size(), 2U) << "a caller cannot fill the log with paths that are told as the same";
+  log.clear();
+  refusals.flush();
+  EXPECT_THAT(log.entries(),
+              ElementsAre(line("refused 2 more check-ins of account 501, executable " + path + "a"),
+                          line("refused 1 more check-ins of account 501, executable " + path + "b")));
 }
 
 TEST_F(RefusalLogTest, APathAsLongAsTheSystemAllowsLeavesRoomForTheReason) {

@@ -376,6 +376,8 @@ INSTANTIATE_TEST_SUITE_P(
         WrongKey{"EmptyUnit", "<key>Unit</key><string></string>", "Unit is not the name of a unit"},
         WrongKey{"PathAsUnit", "<key>Unit</key><string>/system.slice/x.service</string>",
                  "Unit is not the name of a unit"},
+        WrongKey{"SlashInUnit", "<key>Unit</key><string>system.slice/x.service</string>",
+                 "Unit is not the name of a unit"},
         WrongKey{"SHA256", "<key>SHA256</key><data></data>", "SHA256 is data, not a string"},
         WrongKey{"ShortSHA256", "<key>SHA256</key><string>00</string>",
                  "SHA256 is not 64 hexadecimal digits"},
