@@ -971,21 +971,6 @@ TEST_F(FilePreferencesTest, ADomainIsForgottenWhenWhatIsKeptExceedsSixteenMebiby
   }
 }
 
-TEST_F(FilePreferencesTest, AFlushedDomainDoesNotCountForWhatIsKept) {
-  const std::string large = "large";
-  home.write(large, binary(PropertyList::dictionary(
-                        {{"large", PropertyList::data(std::vector<std::byte>(std::size_t{17} << 20))}})));
-  home.write(kDomain, binary(textDictionary("key", "value")));
-  makeOld(file);
-  ASSERT_EQ(get(*ours, "key"), "value");
-  ASSERT_TRUE(ours->copyValue("large", large, kUser, kHost));
-  ours->flushCachesForAnyUser(&large);
-  ours->copyValue("key", "another", kUser, kHost);
-  SystemCalls calls;
-  EXPECT_EQ(get(*ours, "key"), "value");
-  EXPECT_EQ(calls.reads, 0) << "it is still kept";
-}
-
 TEST_F(FilePreferencesTest, ALackOfMemoryIsLoggedAndWhatWasStoredStands) {
   if (!FailingAllocations::kWork) GTEST_SKIP() << "allocations do not fail in this build";
   ASSERT_TRUE(setNow(*ours, "key", "old"));
