@@ -90,6 +90,20 @@ class FilePreferencesTest : public testing::Test {
   }
   std::string line(const std::string& rest) const { return "Preferences " + file.string() + ": " + rest; }
 
+  // Of the domain's files that are open: the number of names that each has left.
+  std::vector<nlink_t> links() const {
+    std::vector<nlink_t> found;
+    for (const auto& entry : fs::directory_iterator("/proc/self/fd")) {
+      std::error_code error;
+      const std::string target = fs::read_symlink(entry.path(), error);
+      struct stat facts;
+      if (target.starts_with(file.string()) && ::stat(entry.path().c_str(), &facts) == 0) {
+        found.push_back(facts.st_nlink);
+      }
+    }
+    return found;
+  }
+
   TestHome home;
   const fs::path file = home.file(kDomain);
   RecordingLog log;
@@ -209,6 +223,30 @@ TEST_F(FilePreferencesTest, WithoutAHomeOrAMachineIdThoseScopesHoldNothing) {
   EXPECT_TRUE(store.copyApplicationValue("key", kDomain));
 }
 
+TEST_F(FilePreferencesTest, WithoutAFolderForAnyUserThatScopeHoldsNothing) {
+  FilePreferences store([this] { return FilePreferences::Places{home.home(), "", TestHome::kMachine}; });
+  store.setValue("key", PropertyList::boolean(true), kDomain, UserScope::anyUser, kHost);
+  ASSERT_EQ(onlyLine(),
+            "Preferences: no folder is known (there is none), the value for domain \"com.example.files\" is "
+            "not stored");
+  EXPECT_FALSE(store.synchronize(kDomain, UserScope::anyUser, kHost));
+}
+
+TEST_F(FilePreferencesTest, ApplicationScopeIsNotWholeWhenOneOfItsScopesCannotBeStored) {
+  fs::remove(home.home());
+  set(*ours, "key", "lost");
+  ours->setValue("key", PropertyList::boolean(true), kDomain, UserScope::anyUser, kHost);
+  EXPECT_FALSE(ours->synchronizeApplication(kDomain));
+  EXPECT_EQ(onlyLine(), line("open home: No such file or directory"));
+  EXPECT_TRUE(home.open()->copyValue("key", kDomain, UserScope::anyUser, kHost)) << "the others are stored";
+}
+
+TEST_F(FilePreferencesTest, RemovingAKeyWhereThereIsNoFileMakesNone) {
+  ours->setValue("key", {}, kDomain, kUser, kHost);
+  EXPECT_TRUE(sync(*ours));
+  EXPECT_FALSE(fs::exists(file));
+}
+
 TEST_F(FilePreferencesTest, AFailedLookUpOfAPlaceIsToldAndTheNextOneDecidesAnew) {
   FilePreferences::Places answer{"", home.anyUser(), "", EMFILE, ENFILE};
   FilePreferences store([&answer] { return answer; });
@@ -232,6 +270,15 @@ TEST_F(FilePreferencesTest, AFailedLookUpOfAPlaceIsToldAndTheNextOneDecidesAnew)
   EXPECT_TRUE(store.synchronize(kDomain, kUser, HostScope::currentHost));
   EXPECT_TRUE(
       fs::exists(home.folder() / "ByHost" / (std::string(kDomain) + "." + TestHome::kMachine + ".plist")));
+  store.setValue("key", PropertyList::boolean(true), kDomain, UserScope::anyUser, kHost);
+  EXPECT_TRUE(store.synchronize(kDomain, UserScope::anyUser, kHost));
+
+  answer = {"", home.anyUser(), TestHome::kMachine, EMFILE, 0};
+  FilePreferences other([&answer] { return answer; });
+  EXPECT_TRUE(other.copyValue("key", kDomain, UserScope::anyUser, kHost));
+  answer = {home.home(), "", "", 0, EMFILE};
+  EXPECT_EQ(get(other, "key"), "kept");
+  EXPECT_TRUE(other.copyValue("key", kDomain, kUser, HostScope::currentHost));
   EXPECT_TRUE(log.entries().empty());
 }
 
@@ -642,6 +689,7 @@ TEST_F(FilePreferencesTest, AForeignFileThatHasSettledIsReadOnceAlsoThroughALink
     SystemCalls calls;
     for (int i = 0; i < 3; ++i) {
       EXPECT_TRUE(sync(*ours));
+      EXPECT_EQ(calls.reads, 1);
       EXPECT_EQ(get(*ours, "key"), "theirs");
     }
     EXPECT_EQ(calls.reads, 1);
@@ -659,19 +707,6 @@ TEST_F(FilePreferencesTest, AFileWrittenInPlaceWithTheSameSizeIsToldByItsTime) {
 }
 
 TEST_F(FilePreferencesTest, TheFileAsReadOrWrittenIsKeptOpenSoThatItsNumberStaysTaken) {
-  // Of the domain's files that are open: the number of names that each has left.
-  const auto links = [this] {
-    std::vector<nlink_t> found;
-    for (const auto& entry : fs::directory_iterator("/proc/self/fd")) {
-      std::error_code error;
-      const std::string target = fs::read_symlink(entry.path(), error);
-      struct stat facts;
-      if (target.starts_with(file.string()) && ::stat(entry.path().c_str(), &facts) == 0) {
-        found.push_back(facts.st_nlink);
-      }
-    }
-    return found;
-  };
   const auto expectKeptAfterItsRemoval = [&] {
     EXPECT_EQ(links(), std::vector<nlink_t>{1});
     fs::remove(file);
@@ -762,8 +797,19 @@ TEST_F(FilePreferencesTest, AFlushedDomainIsReadAgainThoughNothingTellsThatItsFi
   ours->flushCachesForAnyUser(nullptr);
   ours->flushCachesForAnyUser(&unrelated);
   EXPECT_EQ(get(*ours, "key"), "one");
+  EXPECT_EQ(links().size(), 1u);
   ours->flushCachesForAnyUser(&domain);
+  EXPECT_TRUE(links().empty());
   EXPECT_EQ(get(*ours, "key"), "two");
+}
+
+TEST_F(FilePreferencesTest, AFlushedDomainWhoseFileIsRemovedIsMadeAnew) {
+  const std::string domain = kDomain;
+  ASSERT_TRUE(setNow(*ours, "key", "old"));
+  ours->flushCachesForAnyUser(&domain);
+  fs::remove(file);
+  EXPECT_TRUE(setNow(*ours, "another", "new"));
+  EXPECT_EQ(onDisk(), textDictionary("another", "new"));
 }
 
 TEST_F(FilePreferencesTest, ARemovedFileIsAnEmptyDomain) {
