@@ -704,6 +704,16 @@ TEST_F(PortsTest, AReplyForWhichTheKernelNeverHasMemoryEndsItsChannelAfterASecon
   EXPECT_EQ(noMemory.failures(), 1 + 100);
 }
 
+TEST_F(PortsTest, AReplyThatTheKernelRefusesLeavesNothingAndEndsItsChannel) {
+  ASSERT_EQ(ports.deallocateSendRight(port), kern::success);  // the client's copy is the only one
+  const FailingCall refused("send", EPERM, 1);                // after the request
+  EXPECT_FALSE(exchange(message(kRegion).add(kNdrRecord).add(100U)));
+  EXPECT_EQ(refused.failures(), 1);
+  EXPECT_EQ(regions.live(), 0U);
+  EXPECT_FALSE(exchange(message(kEcho)));
+  EXPECT_EQ(table.served, 1) << "nobody reads it any more";
+}
+
 TEST_F(PortsTest, InvalidatingASourceReleasesTheReplyThatWaited) {
   const Datagram large = message(kRegion).add(kNdrRecord).add(60000U);
   // Until one waits; how many go before is up to the system's buffers.
