@@ -556,6 +556,19 @@ class DamagedPreferencesTest : public FilePreferencesTest {
   fs::path aside(int number = 1) const { return file.string() + ".damaged-" + std::to_string(number); }
 };
 
+TEST_F(DamagedPreferencesTest, AGoodFileThatAnotherWriterPutsThereMeanwhileIsNotMovedAside) {
+  home.write(kDomain, "garbage");
+  SystemCalls calls;
+  int looks = 0;
+  calls.beforeLocking = [&] {
+    if (++looks == 1) home.write(kDomain, binary(textDictionary("key", "theirs")));
+  };
+  EXPECT_EQ(get(*ours, "key"), "theirs");
+  EXPECT_EQ(looks, 1);
+  EXPECT_TRUE(log.entries().empty());
+  EXPECT_EQ(home.files(), std::vector<std::string>{"com.example.files.plist"});
+}
+
 TEST_F(DamagedPreferencesTest, ADamagedFileIsMovedAsideAndNeverWrittenOver) {
   std::string good = binary(textDictionary("key", "old"));
   const std::string damaged[] = {"", "garbage", good.substr(0, good.size() - 1),

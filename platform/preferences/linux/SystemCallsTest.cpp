@@ -1,6 +1,7 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <fcntl.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/uio.h>
@@ -66,6 +67,11 @@ extern "C" int renameat2(int fromFolder, const char* from, int toFolder, const c
                          unsigned flags) noexcept {
   if (current != nullptr && brenvik::shallFail(current->failRenameFlags)) return -1;
   return static_cast<int>(::syscall(SYS_renameat2, fromFolder, from, toFolder, to, flags));
+}
+
+extern "C" int flock(int file, int operation) noexcept {
+  if (current != nullptr && current->beforeLocking) current->beforeLocking();
+  return static_cast<int>(::syscall(SYS_flock, file, operation));
 }
 
 extern "C" int open(const char* path, int flags, ...) {

@@ -10,6 +10,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <iterator>
 #include <memory>
 #include <string>
@@ -82,6 +83,7 @@ struct SystemCalls {
   int failRename = 0;
   int failOpen = 0;         // of existing files, for reading
   int failRenameFlags = 0;  // of renames that must not replace anything
+  std::function<void()> beforeLocking;
 
   SystemCalls();
   SystemCalls(const SystemCalls&) = delete;
