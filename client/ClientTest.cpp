@@ -299,6 +299,29 @@ TEST(ClientTest, ARequestThatIsNotAnsweredTimesOutAndItsLateAnswerIsSkipped) {
   EXPECT_EQ(BVMobileHelperResetVoicemailStore(client.get()), 33);
 }
 
+TEST(ClientTest, TheTimeoutOfAnEarlierChannelIsSetOnANewOneToo) {
+  ScriptedHelper helper([](Script& script) {
+    (void)script.receive(script.checkIn());  // and leaves
+    const UniqueFd channel = script.checkIn();
+    script.send(channel, statusReply(script.receive(channel), 0));
+    const Message unanswered = script.receive(channel);
+    pollfd next{channel.get(), POLLIN, 0};
+    const bool hasMore = ::poll(&next, 1, 10'000) == 1;  // who waits without a limit has not
+    script.send(channel, statusReply(unanswered, 1));
+    if (hasMore) script.send(channel, statusReply(script.receive(channel), 33));
+  });
+  const ClientPointer client = clientFor(helper.path());
+  ASSERT_EQ(bvmh_connect(client.get()), BVMH_OK);
+  bvmh_client_set_timeout(client.get(), kShort);
+  EXPECT_NE(BVMobileHelperClearVoicemailToken(client.get()), BVMH_OK);
+  bvmh_client_set_timeout(client.get(), kPlenty);
+  EXPECT_EQ(BVMobileHelperClearVoicemailToken(client.get()), BVMH_OK);
+  bvmh_client_set_timeout(client.get(), kShort);
+  EXPECT_EQ(BVMobileHelperClearVoicemailToken(client.get()), BVMH_ERROR_TIMED_OUT);
+  bvmh_client_set_timeout(client.get(), kPlenty);
+  EXPECT_EQ(BVMobileHelperResetVoicemailStore(client.get()), 33);
+}
+
 TEST(ClientTest, AnAnswerToARequestThatWasAnsweredAlreadyIsALie) {
   ScriptedHelper helper([](Script& script) {
     const UniqueFd channel = script.checkIn();

@@ -272,6 +272,28 @@ TEST_F(FileSystemManagerTest, AMergeReplacesFilesAndKeepsWhatOnlyTheDestinationH
   EXPECT_EQ(contentOf(dir / "from/tree/both"), "new");
 }
 
+TEST_F(FileSystemManagerTest, AMergeThatIsToLastWaitsForTheDiskWhenAllIsInIt) {
+  class Watching final : public FaultyFileManager {
+   public:
+    using FaultyFileManager::FaultyFileManager;
+    FileOutcome syncItem(const std::string& path) noexcept override {
+      callsBefore.push_back(calls.size());
+      return FaultyFileManager::syncItem(path);
+    }
+    std::vector<std::size_t> callsBefore;
+  } watching{real};
+  dir.file("from/tree/one", "1");
+  dir.file("from/tree/two", "2");
+  dir.directory("to/tree");
+  FileSystemManager merging{watching};
+  EXPECT_EQ(merging.copyFileIntoDirectory(dir / "from", dir / "to", "tree"), 0);
+  EXPECT_EQ(contentOf(dir / "to/tree/tree/two"), "2");
+  dir.file("from/tree/three", "3");
+  EXPECT_EQ(merging.copyFileIntoDirectory(dir / "from", dir / "to", "tree"), 0);
+  EXPECT_EQ(contentOf(dir / "to/tree/tree/three"), "3");
+  EXPECT_EQ(watching.callsBefore, std::vector<std::size_t>{watching.calls.size()});
+}
+
 TEST_F(FileSystemManagerTest, AMergeInMoveModeLeavesOnlyEmptiedDirectoriesBehind) {
   dir.file("from/tree/both", "new");
   dir.file("from/tree/fresh/file", "f");

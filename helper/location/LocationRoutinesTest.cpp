@@ -325,6 +325,17 @@ TEST_F(LocationRoutinesTest, ClosedRoutinesDropWhatIsStillUnderWay) {
   EXPECT_TRUE(geo.geoIps.empty());
 }
 
+TEST_F(LocationRoutinesTest, ClosedRoutinesDropAnAddressThatIsStillUnderWay) {
+  askWanIp();
+  settle();
+  geo.geoIps.at(0).answer("198.51.100.7");
+  routines.reset();
+  log.clear();
+  settle();
+  EXPECT_TRUE(brenvik.pushes.empty());
+  EXPECT_EQ(log.entries(), Lines{});
+}
+
 TEST_F(LocationRoutinesTest, AnExceptionWhileQueueingARequestEndsTheProcess) {
   class QueuesWithoutMemory final : public WorkQueues {
    public:

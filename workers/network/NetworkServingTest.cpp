@@ -12,6 +12,7 @@
 #include <mutex>
 #include <string>
 
+#include "platform/base/fakes/FailingAllocations.h"
 #include "platform/geo/fakes/ManualGeoService.h"
 #include "platform/gzip/fakes/GzipOf.h"
 #include "platform/log/fakes/RecordingLog.h"
@@ -487,6 +488,30 @@ TEST_F(NetworkServingTest, MoreThanTheLongestEchoIsNotReceivedInto) {
     echo.arrivals.push_back({1ms, std::vector<std::byte>(60, std::byte{9})});
     EXPECT_EQ(ask(EchoMessageKind::receive, encodeNumber(static_cast<std::uint32_t>(largest))), expected);
   }
+}
+
+TEST_F(NetworkServingTest, AChannelForWhichThereIsNoThreadOrMemoryIsRefusedAndLeavesItsPlace) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "nothing fails under this sanitizer";
+  geo.silent = true;
+  NetworkServing other{{queues, workerWeb, geo, echo}};
+  int refusals = 0;
+  for (bool hasFailed = true; hasFailed;) {
+    WorkerChannel ours;
+    WorkerChannel theirs;
+    ASSERT_EQ(WorkerChannel::makePair(&ours, &theirs), WorkerResult::done);
+    {
+      const FailingAllocations failing(refusals, FailingAllocations::HowMany::one);
+      other.start(static_cast<std::uint32_t>(NetworkWork::publicAddress), std::move(theirs));
+    }
+    hasFailed = FailingAllocations::failures() > 0;
+    if (!hasFailed) continue;
+    ++refusals;
+    WorkerMessage message;
+    ASSERT_EQ(ours.receive(&message, std::chrono::steady_clock::now() + 5s), WorkerResult::done) << refusals;
+    EXPECT_EQ(message.kind, static_cast<std::uint32_t>(NetworkMessage::refusal));
+  }
+  EXPECT_GE(refusals, 2) << "the channel, and what a thread is handed";
+  other.waitUntilIdle();
 }
 
 TEST_F(NetworkServingTest, ChannelsBeyondTheMostAreRefused) {

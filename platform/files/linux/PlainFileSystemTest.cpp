@@ -25,6 +25,8 @@ namespace {
 
 // Is told of each directory before it is opened by its name.
 std::function<void(const char*)> beforeOpening;  // NOLINT
+// Is told of each item before it is held fast on the disk.
+std::function<void(int)> beforeSyncing;  // NOLINT
 
 }  // namespace
 
@@ -66,6 +68,7 @@ extern "C" int fchownat(int folder, const char* path, uid_t uid, gid_t gid, int 
   return static_cast<int>(::syscall(SYS_fchownat, folder, path, uid, gid, flags));
 }
 extern "C" int fsync(int file) {
+  if (beforeSyncing) beforeSyncing(file);
   if (brenvik::FailingCall::failsNow("fsync")) return -1;
   return static_cast<int>(::syscall(SYS_fsync, file));
 }
@@ -254,6 +257,21 @@ TEST_F(PlainFileSystemTest, AnAnswerWaitsForTheNamesAndSaysWhenTheyAreLost) {
   failsWithout("removal", 0, [&] { return files.removeEntry(dir / "link"); });
   failsWithout("file", 0, [&] { return files.syncItem(dir / "source"); });
   failsWithout("file's name", 1, [&] { return files.syncItem(dir / "source"); });
+}
+
+TEST_F(PlainFileSystemTest, AMovesNewNameIsOnTheDiskBeforeItsOldOneMayGoThere) {
+  dir.file("from/item", "x");
+  dir.directory("to");
+  std::vector<ino_t> synced;
+  beforeSyncing = [&](int item) {
+    struct stat info {};
+    EXPECT_EQ(::fstat(item, &info), 0);
+    synced.push_back(info.st_ino);
+  };
+  EXPECT_EQ(files.moveItem(dir / "from/item", dir / "to/item", IfPresent::fail, Durability::onReturn),
+            kSuccess);
+  beforeSyncing = nullptr;
+  EXPECT_EQ(synced, (std::vector<ino_t>{statOf(dir / "to").st_ino, statOf(dir / "from").st_ino}));
 }
 
 TEST_F(PlainFileSystemTest, AMoveAcrossWhoseCopyDoesNotReachTheDiskKeepsTheSource) {

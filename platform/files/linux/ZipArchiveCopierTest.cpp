@@ -20,6 +20,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/files/archive/ArchiveFrames.h"
 #include "platform/files/fakes/ChildProcesses.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
@@ -287,6 +288,21 @@ TEST_F(ZipArchiveCopierTest, IntoADirectoryThatIsThereFilesAreReplacedAndOthersK
   EXPECT_EQ(contentOf(dir / "precious"), "precious");
   EXPECT_EQ(contentOf(dir / "out/new/file"), "n");
   EXPECT_EQ(everything().size(), 10u);
+}
+
+TEST_F(ZipArchiveCopierTest, AnAnswerWaitsForTheContentsAndForTheNamesAndSaysWhenTheyAreLost) {
+  dir.file("out/old", "old");
+  const std::string archive = ZipBuilder().file("old", "new").build();
+  {
+    const FailingCall broken("syncfs", EIO);
+    EXPECT_EQ(unpack(archive), EIO);
+    EXPECT_EQ(broken.failures(), 1);
+    EXPECT_EQ(contentOf(dir / "out/old"), "old");
+  }
+  const FailingCall broken("syncfs", EIO, 1);
+  EXPECT_EQ(unpack(archive), EIO);
+  EXPECT_EQ(broken.failures(), 1);
+  EXPECT_EQ(contentOf(dir / "out/old"), "new");
 }
 
 TEST_F(ZipArchiveCopierTest, AConflictWithWhatIsThereChangesNothing) {

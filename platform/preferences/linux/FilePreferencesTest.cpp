@@ -1014,6 +1014,32 @@ TEST_F(FilePreferencesTest, ALackOfMemoryIsLoggedAndWhatWasStoredStands) {
   EXPECT_EQ(onlyLine(), "Preferences: no memory to flush a domain");
 }
 
+TEST_F(FilePreferencesTest, AFlushReachesTheDomainInEachScopeWhereNoStampTellsOfAChange) {
+  const std::string domain = kDomain;
+  const auto read = [&](UserScope user) {
+    return std::string(ours->copyValue("key", domain, user, kHost).asString().value_or("(none)"));
+  };
+  const std::pair<UserScope, fs::path> places[] = {
+      {UserScope::currentUser, file}, {UserScope::anyUser, home.anyUser() / (domain + ".plist")}};
+  for (const auto& [user, path] : places) {
+    ours->setValue("key", PropertyList::string("old"), domain, user, kHost);
+    ASSERT_TRUE(ours->synchronize(domain, user, kHost));
+    // In place, as long as before, and with the same times.
+    std::string bytes = TestHome::read(path);
+    ASSERT_NE(bytes.find("old"), std::string::npos);
+    bytes.replace(bytes.find("old"), 3, "new");
+    const UniqueFd written(::open(path.c_str(), O_WRONLY | O_CLOEXEC));
+    struct stat before {};
+    ASSERT_EQ(::fstat(written.get(), &before), 0);
+    ASSERT_EQ(::pwrite(written.get(), bytes.data(), bytes.size(), 0), static_cast<ssize_t>(bytes.size()));
+    const timespec times[] = {before.st_atim, before.st_mtim};
+    ASSERT_EQ(::futimens(written.get(), times), 0);
+    EXPECT_EQ(read(user), "old");
+  }
+  ours->flushCachesForAnyUser(&domain);
+  for (const auto& [user, path] : places) EXPECT_EQ(read(user), "new") << path;
+}
+
 TEST_F(FilePreferencesTest, SeveralThreadsShareAStore) {
   ours = home.open(60s);  // of two domains they wait for each other's lock, and a disk may be slow
   std::vector<std::thread> threads;

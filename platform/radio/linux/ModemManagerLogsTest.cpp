@@ -20,7 +20,9 @@
 #include <filesystem>
 #include <fstream>
 #include <mutex>
+#include <new>
 #include <thread>
+#include <utility>
 
 #include "platform/base/UniqueFd.h"
 #include "platform/runloop/fakes/ManualRunLoop.h"
@@ -224,6 +226,33 @@ TEST_F(ModemManagerLogsTest, SwitchingWhileTheQueueIsBusyKeepsTheLastPositionOnl
   EXPECT_EQ(queues.serial.at(0)->pending(), 1U);
   runQueue();
   EXPECT_THAT(manager.calls(), ElementsAre("INFO"));
+}
+
+TEST_F(ModemManagerLogsTest, ASwitchThatCouldNotBeQueuedKeepsNoLaterOneBack) {
+  class QueuesWithoutMemoryAtFirst final : public WorkQueues {
+   public:
+    explicit QueuesWithoutMemoryAtFirst(ManualWorkQueues& others) : others_(others) {}
+    WorkQueue& main() noexcept override { return others_.main(); }
+    WorkQueue& global() override { return others_.global(); }
+    std::shared_ptr<WorkQueue> makeSerial(std::string label, QualityOfService qualityOfService) override {
+      if (std::exchange(isFirst_, false)) throw std::bad_alloc();
+      return others_.makeSerial(std::move(label), qualityOfService);
+    }
+    std::unique_ptr<ProcessExitSource> makeProcessExitSource(pid_t, std::uint32_t, WorkQueue::Task,
+                                                             WorkQueue::Task) override {
+      return nullptr;
+    }
+
+   private:
+    ManualWorkQueues& others_;
+    bool isFirst_ = true;
+  } scarce(queues);
+  ModemManagerLogs logs(scarce, "unix:path=" + (folder / "nobody").string(), kPlenty);
+  logs.setLogToFile(true);
+  EXPECT_THAT(queues.serial, IsEmpty());
+  logs.setLogToFile(true);
+  ASSERT_EQ(queues.serial.size(), 1U);
+  EXPECT_EQ(queues.serial[0]->pending(), 1U);
 }
 
 TEST_F(ModemManagerLogsTest, ARefusalIsTakenAndTheNextSwitchAsksAgain) {

@@ -19,6 +19,8 @@
 #include <csignal>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
+#include <functional>
 #include <thread>
 
 #include "platform/base/ProcessFacts.h"
@@ -35,6 +37,8 @@
 // Calls of this program that a test may let fail. None of the opens here makes a file. Only the symbols have
 // the names of the C library: where its headers check sizes (_FORTIFY_SOURCE), they define functions of these
 // names, and call others, which clang's programs then do.
+static std::function<void(const char*)> beforeOpening;  // is told of each path that is opened
+
 extern "C" {
 ssize_t failingRead(int fd, void* bytes, std::size_t size) __asm__("read");
 ssize_t failingCheckedRead(int fd, void* bytes, std::size_t size, std::size_t room) __asm__("__read_chk");
@@ -57,6 +61,7 @@ int failingLstat(const char* path, struct stat* facts) noexcept {
   return static_cast<int>(::syscall(SYS_newfstatat, AT_FDCWD, path, facts, AT_SYMLINK_NOFOLLOW));
 }
 int failingOpenat(int directory, const char* path, int flags, ...) {
+  if (beforeOpening) beforeOpening(path);
   if (brenvik::FailingCall::failsNow("openat")) return -1;
   return static_cast<int>(::syscall(SYS_openat, directory, path, flags, 0));
 }
@@ -876,6 +881,30 @@ TEST_F(MadeUpProcessTest, AProgramThatBecomesAnotherOneBeforeItIsDigestedIsNoMat
   };
   const auto answer = askHere();
   EXPECT_EQ(accounts.idLookUps, 1);
+  EXPECT_FALSE(answer.value);
+  EXPECT_FALSE(answer.error);
+}
+
+TEST_F(MadeUpProcessTest, AProgramThatIsReplacedBeforeItIsDigestedDoesNotSpeakForItsOldForm) {
+  const fs::path replacement = root / "replacement";
+  write("replacement", "the program's next version");
+  const UniqueFd next(::open(replacement.c_str(), O_RDONLY | O_CLOEXEC));
+  std::string hex;
+  const Sha256Digest digest = sha256OfFile(next.get()).value();
+  for (const std::uint8_t byte : digest) hex += hexOf(byte);
+  grant("etc/a.plist", "<true/>", quoted("SHA256", hex));
+  // The caller goes on with the old one.
+  fs::remove(root / "proc/7/exe");
+  fs::create_hard_link(program, root / "proc/7/exe");
+  bool isReplaced = false;
+  beforeOpening = [&](const char* path) {
+    if (isReplaced || program != path) return;
+    isReplaced = true;
+    fs::rename(replacement, program);
+  };
+  const auto answer = askHere();
+  beforeOpening = nullptr;
+  EXPECT_TRUE(isReplaced);
   EXPECT_FALSE(answer.value);
   EXPECT_FALSE(answer.error);
 }

@@ -25,6 +25,7 @@
 #include <vector>
 
 #include "platform/base/ProcessFacts.h"
+#include "platform/base/fakes/FailingAllocations.h"
 #include "platform/base/fakes/LingeringSocket.h"
 #include "platform/datagram/SealedMemory.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
@@ -181,6 +182,25 @@ TEST_F(WorkerProgramTest, AWorkerThatCannotBeStartedAheadIsToldOnlyByTheOpenThat
   WorkerChannel channel;
   EXPECT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::unavailable);
   EXPECT_EQ(lines().size(), 1U);
+}
+
+TEST_F(WorkerProgramTest, AStartAheadThatLacksMemorySilencesNoLaterLine) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "nothing fails under this sanitizer";
+  bool hasFailed = true;
+  for (long number = 0; hasFailed; ++number) {
+    WorkerProgram worker(description({folder.path()}));
+    log.clear();
+    {
+      const FailingAllocations failing(number, FailingAllocations::HowMany::one);
+      worker.start();
+    }
+    hasFailed = FailingAllocations::failures() > 0;
+    EXPECT_EQ(lines(), std::vector<std::string>()) << number;
+    WorkerChannel channel;
+    EXPECT_EQ(open(worker, WorkForTests::echo, &channel), WorkerResult::unavailable) << number;
+    EXPECT_EQ(lines().size(), 1U) << number;
+    EXPECT_TRUE(hasFailed || number > 0);
+  }
 }
 
 TEST_F(WorkerProgramTest, TheWorkerLeavesWithItsOwner) {

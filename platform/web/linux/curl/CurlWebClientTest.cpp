@@ -1115,6 +1115,25 @@ TEST_F(CurlWebClientNetworkTest, WhatAnEarlierHopTriedOverCellularSaysNothingOfA
   EXPECT_EQ(arrived(0), 0U);
 }
 
+TEST_F(CurlWebClientNetworkTest, ARedirectLeadsNowhereThatARequestMayNotGoLookUpsIncluded) {
+  settings.connectLimit = 300ms;
+  join("pdp_ip0", 1);
+  ASSERT_TRUE(ours.ip("route add default via 10.7.1.2"));
+  std::string target;
+  std::unique_ptr<HttpsServer> server;
+  ours.run([&] {
+    server = std::make_unique<HttpsServer>(identity, [&target](Connection& connection) {
+      connection.readRequest();
+      connection.respond("302 Found\r\nLocation: " + target, "moved");
+    });
+  });
+  for (const char* const away : {"https://lasd.example/", "https://203.0.113.9/", "https://10.7.1.2/"}) {
+    target = away;
+    EXPECT_EQ(outcome(server->url("/", "127.0.0.1"), false), WebErrorKind::cellularNotAllowed) << away;
+  }
+  EXPECT_EQ(arrived(0), 0U);
+}
+
 TEST_F(CurlWebClientNetworkTest, WithoutARouteThereIsNoConnection) {
   EXPECT_EQ(outcome("https://203.0.113.9/", false), WebErrorKind::cannotConnect);
   EXPECT_EQ(outcome("https://203.0.113.9/", true), WebErrorKind::cannotConnect);
