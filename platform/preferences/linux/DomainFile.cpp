@@ -173,11 +173,12 @@ DomainFile::Attempt DomainFile::tryLoad() const {
 }
 
 DomainFile::Loaded DomainFile::load(std::chrono::milliseconds patience, const FolderLock* held) {
-  Attempt attempt = tryLoad();
-  if (attempt.damage == nullptr) {
+  const auto withoutDamage = [this](Attempt& attempt) {
     if (attempt.error != 0) (void)fail("read", attempt.error);
     return std::move(attempt.loaded);
-  }
+  };
+  Attempt attempt = tryLoad();
+  if (attempt.damage == nullptr) return withoutDamage(attempt);
   const UniqueFd folder(
       ::open((place_.root + "/" + place_.folder).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   FolderLock own;
@@ -185,7 +186,7 @@ DomainFile::Loaded DomainFile::load(std::chrono::milliseconds patience, const Fo
     if (!lock(folder.get(), patience, own)) return std::move(attempt.loaded);
     // Another writer may have done all this meanwhile, and put a good file there.
     attempt = tryLoad();
-    if (attempt.damage == nullptr) return std::move(attempt.loaded);
+    if (attempt.damage == nullptr) return withoutDamage(attempt);
   }
   if (moveAside(folder.get(), attempt)) return {};
   return std::move(attempt.loaded);

@@ -70,7 +70,8 @@ class DomainFile {
     FileStamp stamp;
     // Keeps the inode's number from being given to another file as long as the stamp is compared.
     UniqueFd pin;
-    // False: the file is so new that it could change again within the same tick of the file system's clock.
+    // False: the file is so new that it could change again within the same tick of the file system's clock,
+    // or it could not be read for a reason that says nothing about it. Look again the next time.
     bool isSettled = true;
   };
   // Reads the file. Moves a damaged or unreadable file aside, under the lock, which it takes for that time if
@@ -98,10 +99,12 @@ class DomainFile {
     // The file is not to blame.
     void fail(int why) noexcept {
       loaded.state = State::unavailable;
+      loaded.isSettled = false;
       error = why;
     }
     void damaged(const char* what, int why = 0) noexcept {
-      fail(why);
+      loaded.state = State::unavailable;
+      error = why;
       damage = what;
     }
   };

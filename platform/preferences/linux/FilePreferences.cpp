@@ -130,7 +130,8 @@ class FilePreferences::Domain {
   bool isCurrent() const noexcept { return isLoaded_ && isSettled_ && file_.stamp() == stamp_; }
 
   void forgetContent() noexcept {
-    values_ = EditableDictionary();
+    EditableDictionary none;
+    std::swap(values_, none);  // an assignment would keep the memory
     stamp_ = {};
     pin_.reset();
     isLoaded_ = isDurable_ = canStore_ = false;
@@ -151,7 +152,8 @@ class FilePreferences::Domain {
     const UniqueFd folder = file_.openFolder();
     FolderLock held;
     if (!folder.isValid() || !file_.lock(folder.get(), patience_, held)) return false;
-    if (!isCurrent()) load(&held);
+    // What a reader could not mend may be mended under the lock; if not, there is a line that says why.
+    if (!isCurrent() || !canStore_) load(&held);
     if (!canStore_) return false;
     bool isWhole = true;
     bool isChanged = false;

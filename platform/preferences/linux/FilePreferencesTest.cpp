@@ -971,6 +971,22 @@ TEST_F(FilePreferencesTest, ADomainIsForgottenWhenWhatIsKeptExceedsSixteenMebiby
   }
 }
 
+TEST_F(FilePreferencesTest, AFlushedDomainHasNoMemoryThatCountsAgainstOthers) {
+  home.write("small", binary(textDictionary("key", "value")));
+  home.write(kDomain, binary(PropertyList::dictionary(
+                          {{"large", PropertyList::data(std::vector<std::byte>(std::size_t{17} << 20))}})));
+  const std::string domain = kDomain;
+  makeOld(home.file("small"));
+  makeOld(file);
+  EXPECT_TRUE(ours->copyValue("key", "small", kUser, kHost));
+  EXPECT_TRUE(ours->copyValue("large", domain, kUser, kHost));
+  ours->flushCachesForAnyUser(&domain);
+  (void)ours->copyValue("key", "another", kUser, kHost);
+  SystemCalls calls;
+  EXPECT_TRUE(ours->copyValue("key", "small", kUser, kHost));
+  EXPECT_EQ(calls.reads, 0);
+}
+
 TEST_F(FilePreferencesTest, ALackOfMemoryIsLoggedAndWhatWasStoredStands) {
   if (!FailingAllocations::kWork) GTEST_SKIP() << "allocations do not fail in this build";
   ASSERT_TRUE(setNow(*ours, "key", "old"));
@@ -1139,6 +1155,57 @@ TEST_F(DamagedPreferencesTest, AReaderMovesNothingAsideWhileAnotherWriterHoldsTh
   EXPECT_EQ(onlyLine(), line("lock: another writer does not let go of the lock"));
   EXPECT_EQ(TestHome::read(file), "garbage");
   EXPECT_FALSE(fs::exists(aside()));
+}
+
+TEST_F(DamagedPreferencesTest, WhatAReaderCouldNotMoveAsideTheNextWriterDoes) {
+  home.write(kDomain, "garbage");
+  makeOld(file);
+  UniqueFd lock(
+      ::open((home.folder() / ".brenvik-preferences.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+  ASSERT_EQ(::flock(lock.get(), LOCK_EX), 0);
+  ours = home.open(0ms);
+  EXPECT_EQ(get(*ours, "key"), "(none)");
+  EXPECT_EQ(onlyLine(), line("lock: another writer does not let go of the lock"));
+  lock.reset();
+  expectMovedAside("not a property list");
+}
+
+TEST_F(DamagedPreferencesTest, AChangeThatIsDroppedForADamagedFileIsToldEachTime) {
+  home.write(kDomain, "garbage");
+  makeOld(file);
+  const FailingCall denied("renameat2", EACCES, 0, FailingCall::HowOften::always);
+  EXPECT_EQ(get(*ours, "key"), "(none)");
+  const std::string why = line(
+      "damaged (not a property list) and cannot be moved aside (Permission denied); nothing is stored there");
+  EXPECT_EQ(onlyLine(), why);
+  EXPECT_EQ(get(*ours, "key"), "(none)");
+  EXPECT_TRUE(log.entries().empty()) << "a reader tells once what is wrong with a file";
+  for (int i = 0; i < 2; ++i) {
+    EXPECT_FALSE(setNow(*ours, "key", "value"));
+    EXPECT_EQ(onlyLine(), why);
+  }
+  EXPECT_EQ(TestHome::read(file), "garbage");
+}
+
+TEST_F(DamagedPreferencesTest, AReadThatFailedForAMomentIsTriedAgain) {
+  home.write(kDomain, binary(textDictionary("key", "theirs")));
+  makeOld(file);
+  for (const bool isDamagedFirst : {false, true}) {
+    SystemCalls calls;
+    if (isDamagedFirst) {
+      home.write(kDomain, "garbage");
+      calls.hook = [&](std::string_view call) {
+        if (call == "flock") home.write(kDomain, binary(textDictionary("key", "theirs")));
+      };
+    }
+    const FailingCall noMemory("pread", ENOMEM, isDamagedFirst ? 1 : 0);
+    EXPECT_EQ(get(*ours, "key"), "(none)");
+    EXPECT_EQ(noMemory.failures(), 1);
+    EXPECT_EQ(onlyLine(), line("read: Cannot allocate memory"));
+    EXPECT_EQ(get(*ours, "key"), "theirs");
+  }
+  EXPECT_TRUE(setNow(*ours, "key", "ours"));
+  EXPECT_EQ(onDisk(), textDictionary("key", "ours"));
 }
 
 TEST_F(DamagedPreferencesTest, AGoodFileThatAnotherWriterPutThereMeanwhileIsReadAndStays) {
