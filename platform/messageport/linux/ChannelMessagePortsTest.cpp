@@ -63,7 +63,7 @@ TEST_F(ChannelMessagePortsTest, AMessageIsAHeaderWithoutReplyPortAndThenTheData)
   {
     const auto port = ports.openRemote(kName);
     ASSERT_NE(port, nullptr);
-    EXPECT_TRUE(port->send(0, bytesOf("some data")));
+    EXPECT_TRUE(port->send(-7, bytesOf("some data")));
   }
   const auto datagram = receive();  // the sender is gone; its message is not
   ASSERT_EQ(datagram.size(), 24U + 9);
@@ -74,7 +74,7 @@ TEST_F(ChannelMessagePortsTest, AMessageIsAHeaderWithoutReplyPortAndThenTheData)
   EXPECT_EQ(header.replyPort, 0U);
   EXPECT_EQ(header.localPort, 0U);
   EXPECT_EQ(header.voucher, 0U);
-  EXPECT_EQ(header.id, 0);
+  EXPECT_EQ(header.id, -7);
   EXPECT_EQ(std::memcmp(datagram.data() + 24, "some data", 9), 0);
 }
 

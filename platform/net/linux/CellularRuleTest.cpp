@@ -146,7 +146,10 @@ TEST_F(CellularRuleTest, LinkLocalAndDeadRoutesAreNoWayOut) {
   ASSERT_TRUE(network.ip("link set wifi0 up"));
   ASSERT_TRUE(network.ip("link set far1 up"));  // an IPv6 link-local route of its own comes with it
   ASSERT_TRUE(network.ip("address add 169.254.7.7/16 dev wifi0"));
+  ASSERT_TRUE(network.ip("-6 route add febf::/16 dev wifi0"));  // the last of fe80::/10
   EXPECT_FALSE(mayLookUp("server.example"));
+  ASSERT_TRUE(network.ip("-6 route add fec0::/16 dev wifi0"));
+  EXPECT_TRUE(mayLookUp("server.example"));
 }
 
 TEST_F(CellularRuleTest, EveryHopOfAMultipathRouteCounts) {

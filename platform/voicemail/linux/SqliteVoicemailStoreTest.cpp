@@ -163,6 +163,15 @@ TEST_F(SqliteVoicemailStoreTest, ReadingMakesNothingAndWritingMakesAPrivateFileO
   EXPECT_EQ(statOf(home / "Library").st_mode, S_IFDIR | 0755u);
 }
 
+TEST_F(SqliteVoicemailStoreTest, AFileThatOthersMayReadIsMadePrivateWhenItIsOpened) {
+  store.setToken(&token);
+  for (const mode_t mode : {0644U, 0666U, 04600U}) {
+    ASSERT_EQ(::chmod(file.c_str(), mode), 0);
+    EXPECT_EQ(store.copyToken(), token);
+    EXPECT_EQ(statOf(file).st_mode, S_IFREG | 0600U) << mode;
+  }
+}
+
 TEST_F(SqliteVoicemailStoreTest, KilledWhileItMakesItsFoldersItNeverShowsOneTheAccountMayNotEnter) {
   const uid_t owner = ::geteuid() == 0 ? 4711 : ::getuid();
   const gid_t group = ::geteuid() == 0 ? 4712 : ::getgid();
