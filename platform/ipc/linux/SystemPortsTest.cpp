@@ -1,11 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <dirent.h>
+#include <dlfcn.h>
 #include <fcntl.h>
 #include <grp.h>
 #include <gtest/gtest.h>
 #include <malloc.h>
 #include <poll.h>
+#include <pthread.h>
 #include <sched.h>
 #include <sys/file.h>
 #include <sys/mman.h>
@@ -83,6 +85,14 @@ extern "C" ssize_t recvmsg(int fd, msghdr* message, int flags) {
 extern "C" int accept4(int fd, sockaddr* address, socklen_t* size, int flags) {
   if (brenvik::FailingCall::failsNow("accept4")) return -1;
   return static_cast<int>(::syscall(SYS_accept4, fd, address, size, flags));
+}
+
+// Fails for the closing line, which then makes no thread.
+extern "C" int pthread_attr_init(pthread_attr_t* attributes) noexcept {
+  if (brenvik::FailingCall::failsNow("pthread_attr_init")) return ENOMEM;
+  static const auto real =
+      reinterpret_cast<int (*)(pthread_attr_t*)>(::dlsym(RTLD_NEXT, "pthread_attr_init"));
+  return real(attributes);
 }
 
 extern "C" ssize_t send(int fd, const void* bytes, size_t size, int flags) {
@@ -402,6 +412,8 @@ TEST_F(PortsTest, AMessageShorterThanAHeaderIsDroppedInSilenceAndItsDescriptorsA
   ports.closing().drain();
   EXPECT_EQ(openDescriptors(), before);
   EXPECT_EQ(codeOf(message(kEcho)), 0) << "the channel goes on";
+  ASSERT_TRUE(sendTo(client.get(), Datagram().padTo(5)));
+  EXPECT_EQ(codeOf(message(kEcho)), 0) << "the next message was not dropped with it";
 }
 
 TEST_F(PortsTest, ADatagramOfMoreThan65536BytesIsRefused) {
@@ -1974,6 +1986,44 @@ TEST_F(PlayedServiceTest, ATurnLetsIn16AndTheNextOneGoesOn) {
   EXPECT_EQ(table.served, 16);
   knock();
   EXPECT_EQ(table.served, 20);
+}
+
+TEST_F(PlayedServiceTest, NobodyIsLetInWhileTheClosingLineIsFullAndThatIsSaidOnce) {
+  const auto listening = ports.receiveEnd(service);
+  const auto line = RecordingLog::unifiedLine(
+      LogLevel::error, "too many descriptors of refused callers wait to be closed: new clients wait");
+  const auto closeOne = [&] {
+    ports.closing().close(UniqueFd(::fcntl(client.get(), F_DUPFD_CLOEXEC, 0)), 12345);
+  };
+  const UniqueFd first = connect();
+  UniqueFd silent;
+  UniqueFd last;
+  {
+    const FailingCall noThread("pthread_attr_init", ENOMEM, 0, FailingCall::HowOften::always);
+    while (ports.closing().hasRoomFor(3)) closeOne();
+    ASSERT_TRUE(sendTo(first.get(), message(kEcho)));
+    knock();
+    EXPECT_EQ(table.served, 1) << "there is room for two things, and no other stranger";
+    silent = connect();
+    knock();
+    last = connect();
+    ASSERT_TRUE(sendTo(last.get(), message(kEcho)));
+    knock();
+    knock();
+    EXPECT_EQ(table.served, 1);
+    EXPECT_EQ(played.interestIn(listening->get()), Interest::none);
+    EXPECT_EQ(played.timers(), 1U);
+    clock.advance(50ms);
+    EXPECT_EQ(table.served, 1);
+    EXPECT_EQ(played.timers(), 1U);
+    EXPECT_EQ(log.entries(), std::vector{line});
+  }
+  closeOne();  // makes the thread
+  ports.closing().drain();
+  clock.advance(50ms);
+  EXPECT_EQ(table.served, 2);
+  EXPECT_EQ(played.interestIn(listening->get()), Interest::reading);
+  EXPECT_EQ(played.timers(), 0U);
 }
 
 TEST_F(PlayedServiceTest, WhoeverWaitsAndCannotBeListenedToAgainIsGivenUp) {
