@@ -1,11 +1,13 @@
 // SPDX-License-Identifier: Apache-2.0
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include <dirent.h>
+#include <dlfcn.h>
 #include <fcntl.h>
 #include <grp.h>
 #include <gtest/gtest.h>
 #include <malloc.h>
 #include <poll.h>
+#include <pthread.h>
 #include <sched.h>
 #include <sys/file.h>
 #include <sys/mman.h>
@@ -78,6 +80,19 @@ extern "C" int nanosleep(const timespec* time, timespec* left) {
 extern "C" ssize_t recvmsg(int fd, msghdr* message, int flags) {
   ++brenvik::looksAtSockets;
   return ::syscall(SYS_recvmsg, fd, message, flags);
+}
+
+extern "C" int accept4(int fd, sockaddr* address, socklen_t* size, int flags) {
+  if (brenvik::FailingCall::failsNow("accept4")) return -1;
+  return static_cast<int>(::syscall(SYS_accept4, fd, address, size, flags));
+}
+
+// Fails for the closing line, which then makes no thread.
+extern "C" int pthread_attr_init(pthread_attr_t* attributes) noexcept {
+  if (brenvik::FailingCall::failsNow("pthread_attr_init")) return ENOMEM;
+  static const auto real =
+      reinterpret_cast<int (*)(pthread_attr_t*)>(::dlsym(RTLD_NEXT, "pthread_attr_init"));
+  return real(attributes);
 }
 
 extern "C" ssize_t send(int fd, const void* bytes, size_t size, int flags) {
@@ -198,6 +213,7 @@ class TestTable final : public RoutineTable {
       }
       case kGiveRight: {
         auto& out = reply.as<CheckInReply>();
+        out.header.voucher = 9;
         out.header.bits = kReplyDisposition | kComplexBit;
         out.header.size = sizeof out;
         out.descriptorCount = 1;
@@ -211,6 +227,7 @@ class TestTable final : public RoutineTable {
         reply.setStatus(self.refuseWith);
         return Outcome::refused;
       case kThrow:
+        reply.header().voucher = 9;
         throw std::bad_alloc();
       default:
         reply.setStatus(sum);
@@ -395,6 +412,8 @@ TEST_F(PortsTest, AMessageShorterThanAHeaderIsDroppedInSilenceAndItsDescriptorsA
   ports.closing().drain();
   EXPECT_EQ(openDescriptors(), before);
   EXPECT_EQ(codeOf(message(kEcho)), 0) << "the channel goes on";
+  ASSERT_TRUE(sendTo(client.get(), Datagram().padTo(5)));
+  EXPECT_EQ(codeOf(message(kEcho)), 0) << "the next message was not dropped with it";
 }
 
 TEST_F(PortsTest, ADatagramOfMoreThan65536BytesIsRefused) {
@@ -404,7 +423,10 @@ TEST_F(PortsTest, ADatagramOfMoreThan65536BytesIsRefused) {
 }
 
 TEST_F(PortsTest, WhenMemoryRunsOutInARoutineTheRequestFailsAndTheProcessGoesOn) {
-  EXPECT_EQ(codeOf(message(kThrow)), kern::resourceShortage);
+  const auto answer = exchange(message(kThrow));
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->code(), kern::resourceShortage);
+  EXPECT_EQ(answer->header().voucher, 0U) << "what the routine had written is gone";
   EXPECT_EQ(codeOf(message(kEcho)), 0);
 }
 
@@ -412,6 +434,78 @@ TEST_F(PortsTest, AMessageNobodyAskedATrailerForHasTypeAndSizeOnly) {
   codeOf(message(kEcho));
   EXPECT_EQ(table.trailer.type, 0U);
   EXPECT_EQ(table.trailer.size, 8U);
+}
+
+TEST_F(PortsTest, ATrailerNamesTheSenderOnlyWhereItWasAskedForAndTheKernelTells) {
+  for (const auto wanted : {WantTrailer::yes, WantTrailer::no}) {
+    for (const bool isTold : {false, true}) {
+      const int on = isTold ? 1 : 0;
+      ASSERT_EQ(::setsockopt(ports.receiveEnd(port)->get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on), 0);
+      source->invalidate();
+      source = sources.makeRoutineSource(port, table, wanted);
+      ASSERT_TRUE(source->addTo(*loop));
+      ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
+      pump();
+      ASSERT_TRUE(receiveFrom(client.get()));
+      if (wanted == WantTrailer::yes && isTold) continue;  // a client's channel has no peer to compare with
+      EXPECT_EQ(table.trailer.size, 8U);
+      EXPECT_EQ(table.trailer.auditToken[5], 0U);
+    }
+  }
+}
+
+TEST_F(PortsTest, ASourceThatWasInvalidatedServesNeverAgain) {
+  source->invalidate();
+  EXPECT_FALSE(source->addTo(*loop));
+  source->invalidate();
+  EXPECT_FALSE(exchange(message(kEcho)));
+  EXPECT_EQ(table.served, 0);
+}
+
+TEST_F(PortsTest, ARoutineMayDestroyTheSourceThatCalledIt) {
+  table.whileServing = [&] { source.reset(); };
+  EXPECT_FALSE(exchange(message(kRegion).add(kNdrRecord).add(100U)));
+  EXPECT_EQ(regions.live(), 0U);
+  ASSERT_TRUE(sendTo(client.get(), message(kEcho)));
+  pump();
+  EXPECT_EQ(table.served, 1);
+}
+
+TEST_F(PortsTest, WithoutMemoryForASourceOrAWatchThereIsNone) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "operator new belongs to the sanitizer";
+  source->invalidate();
+  auto [theirs, ours] = pair();
+  const PortName watched = ports.adoptSendRight(std::move(ours));
+  const std::size_t before = openDescriptors();
+  const auto oneFails = [](const std::function<bool()>& make) {
+    int refused = 0;
+    for (long first = 0;; ++first) {
+      const FailingAllocations noMemory(first, FailingAllocations::HowMany::one);
+      const bool isMade = make();
+      if (FailingAllocations::failures() == 0) {
+        EXPECT_TRUE(isMade);
+        return refused;
+      }
+      if (!isMade) ++refused;
+    }
+  };
+  EXPECT_GE(oneFails([&] {
+              const auto made = sources.makeRoutineSource(port, table, WantTrailer::no);
+              return made != nullptr && made->addTo(*loop);
+            }),
+            2);
+  EXPECT_GE(oneFails([&] { return sources.makeDeathWatch(watched, *loop) != nullptr; }), 2);
+  EXPECT_EQ(openDescriptors(), before);
+}
+
+TEST_F(PortsTest, ADescriptorWithTheNumber0TravelsLikeEveryOther) {
+  const UniqueFd standardInput(::fcntl(0, F_DUPFD_CLOEXEC, 3));
+  if (!standardInput.isValid()) GTEST_SKIP() << "there is no standard input";
+  ::close(0);
+  const auto answer = exchange(message(kRegion).add(kNdrRecord).add(100000U));  // takes the lowest number
+  ASSERT_EQ(::dup2(standardInput.get(), 0), 0);
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(answer->fds.size(), 1U);
 }
 
 // ---- regions of requests ----
@@ -634,6 +728,7 @@ TEST_F(PortsTest, ACheckInWhoseRightIsNotThereIsAnsweredWith6AndThatAlone) {
   EXPECT_EQ(answer->header().bits, 18U);
   EXPECT_EQ(answer->header().size, 36U);
   EXPECT_EQ(answer->header().localPort, 0xABCDU);
+  EXPECT_EQ(answer->header().voucher, 0U) << "what the routine had written is gone";
   EXPECT_EQ(answer->header().id, kGiveRight + 100);
 }
 
@@ -823,6 +918,30 @@ TEST_F(PlayedLoopTest, AReplyWaitsForMemoryWithATimerAndForRoomWithoutOneWhichev
     ASSERT_TRUE(answer);
     EXPECT_EQ(answer->bytes.size(), 56U + 1000U);
   }
+}
+
+TEST_F(PlayedLoopTest, AReplyForWhichThereIsNoMemoryIsTriedEvery10MillisecondsForASecond) {
+  askForRegion();
+  const FailingCall noMemory("send", ENOMEM, 0, FailingCall::HowOften::always);
+  played.makeReady(fd, kReadable);
+  clock.advance(10ms - 1ns);
+  EXPECT_EQ(noMemory.failures(), 1);
+  clock.advance(1ns);
+  EXPECT_EQ(noMemory.failures(), 2);
+  clock.advance(990ms - 1ns);
+  EXPECT_FALSE(hasEnded());
+  EXPECT_EQ(regions.live(), 1U);
+  clock.advance(1ns);
+  EXPECT_TRUE(hasEnded());
+  EXPECT_EQ(noMemory.failures(), 1 + 100);
+  EXPECT_EQ(regions.live(), 0U);
+}
+
+TEST_F(PlayedLoopTest, ASourceThatTheLoopCannotWatchIsNotServed) {
+  played.refuseDescriptors = true;
+  const auto refused = sources.makeRoutineSource(port, table, WantTrailer::no);
+  EXPECT_FALSE(refused->addTo(played));
+  EXPECT_EQ(sources.makeDeathWatch(port, played), nullptr);
 }
 
 TEST_F(PlayedLoopTest, AReplyThatCannotBeSentEndsItsChannelAndNothingOfItIsLeft) {
@@ -1064,6 +1183,20 @@ TEST_F(BusyClientTest, ATurnEndsAfter20MillisecondsAndNotBefore) {
   EXPECT_EQ(table.served, served + 2);
 }
 
+TEST_F(BusyClientTest, ALookInVainIsTheLastUntilRequestsWaitAgain) {
+  clockStep = 0ns;
+  ASSERT_LE(turnsForRequestsThatWait(), 32);
+  clockStep = BacklogGuess::kAtOnce;  // whatever comes now, the loop had to wait for
+  const auto looksForOneMore = [&] {
+    const int before = looksAtSockets;
+    EXPECT_TRUE(sendTo(client.get(), message(kEcho)));
+    loop->run(0s, ReturnAfterSource::yes);
+    return looksAtSockets - before;
+  };
+  EXPECT_LE(looksForOneMore(), 2) << "the second is in vain";
+  for (int i = 0; i < 20; ++i) EXPECT_EQ(looksForOneMore(), 1) << i;
+}
+
 TEST_F(BusyClientTest, OneWayRequestsThatTakeLongCostAnotherClientTwoOfThem) {
   clockStep = 0ns;
   table.whileServing = [] { steppedTime += 30ms; };
@@ -1215,6 +1348,11 @@ class ServiceTest : public PortsTest {
   static bool isClosed(const UniqueFd& fd) {
     char byte = 0;
     return ::recv(fd.get(), &byte, 1, MSG_DONTWAIT | MSG_PEEK) == 0;
+  }
+  // Also where the other end left a message unread, which takes the place of the end of file.
+  static bool hasHungUp(const UniqueFd& fd) {
+    pollfd state{fd.get(), 0, 0};
+    return ::poll(&state, 1, 0) == 1;
   }
 
   std::string root;       // of all that a test makes
@@ -1597,7 +1735,7 @@ TEST_F(ServiceTest, ARoutineMayInvalidateTheServiceThatCalledIt) {
   pump();
   EXPECT_EQ(table.served, 1);
   EXPECT_FALSE(receiveFrom(connection.get()));
-  EXPECT_TRUE(isClosed(connection));
+  EXPECT_TRUE(hasHungUp(connection));
   ASSERT_TRUE(sendTo(another.get(), message(kEcho)));
   pump();
   EXPECT_EQ(table.served, 1) << "nobody else is served";
@@ -1605,6 +1743,316 @@ TEST_F(ServiceTest, ARoutineMayInvalidateTheServiceThatCalledIt) {
   ports.closing().drain();
   pollfd hungUp{kept.get(), POLLIN, 0};
   EXPECT_EQ(::poll(&hungUp, 1, 0), 1) << "none is left";
+}
+
+TEST_F(ServiceTest, ARoutineMayDestroyTheServiceThatCalledIt) {
+  listen();
+  const UniqueFd connection = connect();
+  const UniqueFd another = connect();
+  pump();
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  ASSERT_TRUE(sendTo(another.get(), message(kEcho)));
+  table.whileServing = [&] { serviceSource.reset(); };
+  pump();
+  EXPECT_EQ(table.served, 1);
+  EXPECT_TRUE(hasHungUp(connection));
+  EXPECT_TRUE(hasHungUp(another));
+}
+
+TEST_F(ServiceTest, WhoWasRefusedIsNotCountedAmongTheClients) {
+  listen();
+  const UniqueFd admitted = connect();
+  ASSERT_TRUE(sendTo(admitted.get(), message(kEcho)));
+  pump();
+  ASSERT_TRUE(receiveFrom(admitted.get()));
+  std::vector<UniqueFd> refused;
+  for (int i = 0; i < 70; ++i) {
+    refused.push_back(connect());
+    ASSERT_TRUE(sendTo(refused.back().get(), message(i % 2 == 0 ? kRefuse : kThrow - 100)));
+    pump();
+    ASSERT_TRUE(receiveFrom(refused.back().get()));
+  }
+  EXPECT_FALSE(isClosed(admitted));
+  EXPECT_EQ(std::count_if(refused.begin(), refused.end(), isClosed), 70 - 64) << "they are strangers still";
+}
+
+TEST_F(ServiceTest, AServiceKeepsItsReserveWhileItServesAndGivesItBackAtItsEnd) {
+  ASSERT_EQ(bootstrap().checkIn("service", &service), kern::success);
+  const std::size_t before = openDescriptors();
+  serviceSource = sources.makeRoutineSource(service, table, WantTrailer::yes);
+  ASSERT_TRUE(serviceSource->addTo(*loop));
+  EXPECT_EQ(openDescriptors(), before + 8);
+  UniqueFd connection = connect();
+  Datagram two = message(kEcho);
+  two.fds.assign(2, client.get());
+  for (int i = 0; i < 3; ++i) {
+    ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+    pump();
+    ASSERT_TRUE(receiveFrom(connection.get()));
+    EXPECT_EQ(openDescriptors(), before + 8 + 2) << "both ends of the connection";
+  }
+  ASSERT_TRUE(sendTo(connection.get(), two));
+  pump();
+  ports.closing().drain();
+  pump();
+  EXPECT_EQ(openDescriptors(), before + 8 + 2 + 1) << "what tells of dropped messages";
+  serviceSource->invalidate();
+  connection.reset();
+  ports.closing().drain();
+  EXPECT_EQ(openDescriptors(), before + 1);
+}
+
+TEST_F(ServiceTest, AStrangersMessageShorterThanAHeaderIsDroppedInSilenceWithWhatItCarries) {
+  listen();
+  const UniqueFd connection = connect();
+  auto [kept, sent] = pair();
+  for (const std::size_t count : {std::size_t{0}, std::size_t{1}, std::size_t{2}}) {
+    Datagram datagram;
+    datagram.padTo(23);
+    datagram.fds.assign(count, sent.get());
+    ASSERT_TRUE(sendTo(connection.get(), datagram));
+    ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+    pump();
+    std::optional<Answer> answer;
+    while (!(answer = receiveFrom(connection.get()))) {
+      ASSERT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource) << count;
+    }
+    EXPECT_EQ(answer->code(), 0);
+    EXPECT_FALSE(receiveFrom(connection.get())) << "the short one is not answered";
+  }
+  sent.reset();
+  ports.closing().drain();
+  pollfd hungUp{kept.get(), POLLIN, 0};
+  EXPECT_EQ(::poll(&hungUp, 1, 0), 1) << "none is kept";
+}
+
+// The channel is not listened to while its message is dropped.
+TEST_F(ServiceTest, AStrangerWhoseMessageIsDroppedElsewhereAndWhoseAnswerDoesNotFitIsGivenUp) {
+  listen();
+  const UniqueFd connection = connect();
+  Datagram request = complexMessage(kKeepRight, 1, 40).add(right());
+  request.fds.assign(2, client.get());
+  ASSERT_TRUE(sendTo(connection.get(), request));
+  {
+    const FailingCall full("send", EAGAIN);
+    pump();
+    EXPECT_EQ(full.failures(), 1);
+  }
+  while (!isClosed(connection)) {
+    ASSERT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);
+  }
+}
+
+TEST_F(ServiceTest, AConnectionThatFailsWhileItIsLetInKeepsNobodyElseWaiting) {
+  listen();
+  for (const int error : {EINTR, ECONNABORTED}) {
+    const UniqueFd connection = connect();
+    ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+    const FailingCall aborted("accept4", error);
+    loop->run(0s, ReturnAfterSource::yes);
+    EXPECT_EQ(aborted.failures(), 1);
+    EXPECT_TRUE(receiveFrom(connection.get())) << error;
+  }
+}
+
+TEST_F(ServiceTest, ASystemOutOfDescriptorsIsLikeAProcessOutOfThem) {
+  listen();
+  const UniqueFd silent = connect();
+  pump();
+  const UniqueFd connection = connect();
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  const FailingCall full("accept4", ENFILE);
+  pump();
+  EXPECT_TRUE(isClosed(silent)) << "a stranger gives its place up";
+  EXPECT_TRUE(receiveFrom(connection.get()));
+}
+
+TEST_F(ServiceTest, WithoutMemoryForAConnectionItIsClosedAndNothingOfItIsLeft) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "operator new belongs to the sanitizer";
+  listen();
+  {
+    const UniqueFd first = connect();
+    pump();
+  }
+  pump();
+  ports.closing().drain();
+  const std::size_t before = openDescriptors();
+  int closed = 0;
+  long failures = 0;
+  for (long at = 0; at == 0 || failures > 0; ++at) {
+    const UniqueFd connection = connect();
+    {
+      const FailingAllocations noMemory(at, FailingAllocations::HowMany::one);
+      (void)loop->run(0s, ReturnAfterSource::yes);
+      failures = FailingAllocations::failures();
+    }
+    pump();
+    if (isClosed(connection)) {
+      ++closed;
+      ports.closing().drain();
+      EXPECT_EQ(openDescriptors(), before + 1) << at;
+      continue;
+    }
+    ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+    pump();
+    EXPECT_TRUE(receiveFrom(connection.get())) << at;
+    serviceSource->invalidate();
+    serviceSource = sources.makeRoutineSource(service, table, WantTrailer::yes);
+    ASSERT_TRUE(serviceSource->addTo(*loop));
+  }
+  EXPECT_GE(closed, 3);
+}
+
+TEST_F(ServiceTest, AConnectionFromBeforeTheServiceAskedForCredentialsNamesItsSenderAfterwards) {
+  UniqueFd listening(::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strcpy(address.sun_path, path().c_str());
+  ASSERT_EQ(::bind(listening.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+  ASSERT_EQ(::listen(listening.get(), 8), 0);
+  const UniqueFd connection = connect();
+  service = ports.adoptService(std::move(listening), path());
+  serviceSource = sources.makeRoutineSource(service, table, WantTrailer::yes);
+  ASSERT_TRUE(serviceSource->addTo(*loop));
+  pump();
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  pump();
+  ASSERT_TRUE(receiveFrom(connection.get()));
+  EXPECT_EQ(table.trailer.size, 52U);
+  EXPECT_EQ(table.trailer.auditToken[5], static_cast<std::uint32_t>(::getpid()));
+}
+
+TEST_F(ServiceTest, OnlyRefusalsForSecurityMakeAnAccountWait) {
+  listen();
+  const UniqueFd connection = connect();
+  for (const KernelReturn code : {kern::failure, kern::noAccess, kern::invalidSecurity + 1}) {
+    table.refuseWith = code;
+    for (int i = 0; i < 150; ++i) {
+      ASSERT_TRUE(sendTo(connection.get(), message(kRefuse)));
+      pump();
+      ASSERT_TRUE(receiveFrom(connection.get())) << i;
+    }
+  }
+}
+
+TEST_F(ServiceTest, NoAccountWaitsWhereRefusalsAreUnlimited) {
+  ASSERT_EQ(bootstrap().checkIn("service", &service), kern::success);
+  SystemPortSources unlimited(ports, regions, SystemPortSources::Refusals::unlimited);
+  serviceSource = unlimited.makeRoutineSource(service, table, WantTrailer::yes);
+  ASSERT_TRUE(serviceSource->addTo(*loop));
+  table.refuseWith = kern::invalidSecurity;
+  const UniqueFd connection = connect();
+  for (int i = 0; i < 300; ++i) {
+    ASSERT_TRUE(sendTo(connection.get(), message(kRefuse)));
+    pump();
+    ASSERT_TRUE(receiveFrom(connection.get())) << i;
+  }
+  serviceSource.reset();
+}
+
+// A service whose loop the test plays.
+class PlayedServiceTest : public ServiceTest {
+ protected:
+  void SetUp() override {
+    ServiceTest::SetUp();
+    ASSERT_EQ(bootstrap().checkIn("service", &service), kern::success);
+    serviceSource = sources.makeRoutineSource(service, table, WantTrailer::yes);
+    ASSERT_TRUE(serviceSource->addTo(played));
+  }
+  void TearDown() override {
+    serviceSource.reset();
+    ServiceTest::TearDown();
+  }
+  void knock() { ASSERT_TRUE(played.makeReady(ports.receiveEnd(service)->get(), {.isReadable = true})); }
+  // A new connection with a request that is refused. Whether it got its answer at once.
+  bool isRefusedAtOnce(UniqueFd* connection) {
+    *connection = connect();
+    EXPECT_TRUE(sendTo(connection->get(), message(kRefuse)));
+    knock();
+    return receiveFrom(connection->get()).has_value();
+  }
+
+  ManualClock clock;
+  ManualRunLoop played{clock};
+};
+
+TEST_F(PlayedServiceTest, ATurnLetsIn16AndTheNextOneGoesOn) {
+  std::vector<UniqueFd> connections;
+  for (int i = 0; i < 20; ++i) {
+    connections.push_back(connect());
+    ASSERT_TRUE(sendTo(connections.back().get(), message(kEcho)));
+  }
+  knock();
+  EXPECT_EQ(table.served, 16);
+  knock();
+  EXPECT_EQ(table.served, 20);
+}
+
+TEST_F(PlayedServiceTest, NobodyIsLetInWhileTheClosingLineIsFullAndThatIsSaidOnce) {
+  const auto listening = ports.receiveEnd(service);
+  const auto line = RecordingLog::unifiedLine(
+      LogLevel::error, "too many descriptors of refused callers wait to be closed: new clients wait");
+  const auto closeOne = [&] {
+    ports.closing().close(UniqueFd(::fcntl(client.get(), F_DUPFD_CLOEXEC, 0)), 12345);
+  };
+  const UniqueFd first = connect();
+  UniqueFd silent;
+  UniqueFd last;
+  {
+    const FailingCall noThread("pthread_attr_init", ENOMEM, 0, FailingCall::HowOften::always);
+    while (ports.closing().hasRoomFor(3)) closeOne();
+    ASSERT_TRUE(sendTo(first.get(), message(kEcho)));
+    knock();
+    EXPECT_EQ(table.served, 1) << "there is room for two things, and no other stranger";
+    silent = connect();
+    knock();
+    last = connect();
+    ASSERT_TRUE(sendTo(last.get(), message(kEcho)));
+    knock();
+    knock();
+    EXPECT_EQ(table.served, 1);
+    EXPECT_EQ(played.interestIn(listening->get()), Interest::none);
+    EXPECT_EQ(played.timers(), 1U);
+    clock.advance(50ms);
+    EXPECT_EQ(table.served, 1);
+    EXPECT_EQ(played.timers(), 1U);
+    EXPECT_EQ(log.entries(), std::vector{line});
+  }
+  closeOne();  // makes the thread
+  ports.closing().drain();
+  clock.advance(50ms);
+  EXPECT_EQ(table.served, 2);
+  EXPECT_EQ(played.interestIn(listening->get()), Interest::reading);
+  EXPECT_EQ(played.timers(), 0U);
+}
+
+TEST_F(PlayedServiceTest, WhoeverWaitsAndCannotBeListenedToAgainIsGivenUp) {
+  table.refuseWith = kern::invalidSecurity;
+  UniqueFd connection;
+  int answers = 0;
+  while (isRefusedAtOnce(&connection)) ASSERT_LT(++answers, 1000);
+  EXPECT_EQ(played.timers(), 1U);
+  EXPECT_FALSE(hasHungUp(connection));
+  played.refuseDescriptors = true;
+  clock.advance(50ms - 1ns);
+  EXPECT_FALSE(hasHungUp(connection));
+  clock.advance(1ns);
+  ports.closing().drain();
+  EXPECT_TRUE(hasHungUp(connection));
+  EXPECT_EQ(played.timers(), 0U);
+}
+
+TEST_F(PlayedServiceTest, WithoutATimerNobodyIsMadeToWait) {
+  table.refuseWith = kern::invalidSecurity;
+  played.refuseTimers = true;
+  UniqueFd connection;
+  for (int i = 0; i < 200; ++i) ASSERT_TRUE(isRefusedAtOnce(&connection)) << i;
+}
+
+TEST_F(PlayedServiceTest, AServiceThatTheLoopCannotWatchIsNotServed) {
+  serviceSource = sources.makeRoutineSource(service, table, WantTrailer::yes);
+  played.refuseDescriptors = true;
+  EXPECT_FALSE(serviceSource->addTo(played));
 }
 
 TEST_F(ServiceTest, AnAdmittedConnectionIsNotGivenUpForOthers) {
@@ -1769,7 +2217,7 @@ TEST_F(ServiceTest, WhoeverIsServedFindsDescriptorsForALook) {
   const DescriptorShortage shortage(1);  // for the connection
   pump();
   EXPECT_EQ(table.served, 1);
-  EXPECT_GE(opened, 8);
+  EXPECT_EQ(opened, 8);
 }
 
 TEST_F(ServiceTest, ConnectionsOfManyAccountsGiveWayWhenDescriptorsRunOut) {
