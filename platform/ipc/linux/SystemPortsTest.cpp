@@ -310,6 +310,30 @@ class PortsTest : public testing::Test {
     return {UniqueFd(ends[0]), UniqueFd(ends[1])};
   }
 
+  // Makes it again and again, with one allocation failing each time, until none does. How often it was not
+  // made.
+  static int refusalsOf(const std::function<bool()>& make) {
+    int refused = 0;
+    for (long first = 0;; ++first) {
+      const FailingAllocations noMemory(first, FailingAllocations::HowMany::one);
+      const bool isMade = make();
+      if (FailingAllocations::failures() == 0) {
+        EXPECT_TRUE(isMade);
+        return refused;
+      }
+      if (!isMade) ++refused;
+    }
+  }
+  // A new source's way onto the loop.
+  bool addNewSource(PortName served) {
+    std::shared_ptr<RoutineSource> made;
+    {
+      const FailingAllocations::Pause pause;
+      made = sources.makeRoutineSource(served, table, WantTrailer::no);
+    }
+    return made->addTo(*loop);
+  }
+
   RecordingLog log;
   std::unique_ptr<SystemRunLoop> loop = SystemRunLoop::make();
   SystemPortSpace ports;
@@ -477,24 +501,10 @@ TEST_F(PortsTest, WithoutMemoryForASourceOrAWatchThereIsNone) {
   auto [theirs, ours] = pair();
   const PortName watched = ports.adoptSendRight(std::move(ours));
   const std::size_t before = openDescriptors();
-  const auto oneFails = [](const std::function<bool()>& make) {
-    int refused = 0;
-    for (long first = 0;; ++first) {
-      const FailingAllocations noMemory(first, FailingAllocations::HowMany::one);
-      const bool isMade = make();
-      if (FailingAllocations::failures() == 0) {
-        EXPECT_TRUE(isMade);
-        return refused;
-      }
-      if (!isMade) ++refused;
-    }
-  };
-  EXPECT_GE(oneFails([&] {
-              const auto made = sources.makeRoutineSource(port, table, WantTrailer::no);
-              return made != nullptr && made->addTo(*loop);
-            }),
-            2);
-  EXPECT_GE(oneFails([&] { return sources.makeDeathWatch(watched, *loop) != nullptr; }), 2);
+  const auto makeSource = [&] { return sources.makeRoutineSource(port, table, WantTrailer::no) != nullptr; };
+  EXPECT_GE(refusalsOf(makeSource), 2);
+  EXPECT_GE(refusalsOf([&] { return addNewSource(port); }), 1);
+  EXPECT_GE(refusalsOf([&] { return sources.makeDeathWatch(watched, *loop) != nullptr; }), 2);
   EXPECT_EQ(openDescriptors(), before);
 }
 
@@ -1640,6 +1650,30 @@ TEST_F(HandedOverTest, ACountThatIsNoneOrTooLargeEndsAtTheDescriptorsThereAre) {
   }
 }
 
+// Takes every descriptor that this process may have, and gives `count` back.
+class DescriptorShortage {
+ public:
+  explicit DescriptorShortage(std::size_t count) {
+    ::getrlimit(RLIMIT_NOFILE, &before_);
+    const rlimit tight{std::min<rlim_t>(before_.rlim_max, 256), before_.rlim_max};
+    ::setrlimit(RLIMIT_NOFILE, &tight);
+    for (;;) {
+      UniqueFd filler(::dup(0));
+      if (!filler.isValid()) break;
+      fillers_.push_back(std::move(filler));
+    }
+    giveBack(count);
+  }
+  ~DescriptorShortage() { ::setrlimit(RLIMIT_NOFILE, &before_); }
+  DescriptorShortage(const DescriptorShortage&) = delete;
+  DescriptorShortage& operator=(const DescriptorShortage&) = delete;
+  void giveBack(std::size_t count) { fillers_.resize(fillers_.size() - count); }
+
+ private:
+  rlimit before_{};
+  std::vector<UniqueFd> fillers_;
+};
+
 TEST_F(ServiceTest, MessagesOfTheServicePortCarryTheKernelsWordOnTheirSender) {
   listen();
   const UniqueFd connection = connect();
@@ -1867,6 +1901,42 @@ TEST_F(ServiceTest, ASystemOutOfDescriptorsIsLikeAProcessOutOfThem) {
   EXPECT_TRUE(receiveFrom(connection.get()));
 }
 
+TEST_F(ServiceTest, TheFirstMessageThatIsDroppedElsewhereFindsADescriptorForThat) {
+  listen();
+  const UniqueFd connection = connect();
+  pump();
+  Datagram request = complexMessage(kKeepRight, 1, 40).add(right());
+  request.fds.assign(2, client.get());
+  ASSERT_TRUE(sendTo(connection.get(), request));
+  {
+    const FailingCall noThread("pthread_attr_init", ENOMEM, 0, FailingCall::HowOften::always);
+    const DescriptorShortage shortage(1);  // for what is looked at of the message, and not closed yet
+    pump();
+    const auto answer = receiveFrom(connection.get());
+    ASSERT_TRUE(answer);
+    EXPECT_EQ(answer->code(), -304);
+    EXPECT_FALSE(hasHungUp(connection));
+  }
+  ports.closing().close(UniqueFd(::fcntl(client.get(), F_DUPFD_CLOEXEC, 0)),
+                        ::getuid());  // makes the thread
+  ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
+  std::optional<Answer> answer;
+  while (!(answer = receiveFrom(connection.get()))) {
+    ASSERT_EQ(loop->run(10s, ReturnAfterSource::yes), RunResult::handledSource);
+  }
+  EXPECT_EQ(answer->code(), 0);
+}
+
+TEST_F(ServiceTest, WithoutMemoryForAServiceThereIsNone) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "operator new belongs to the sanitizer";
+  ASSERT_EQ(bootstrap().checkIn("service", &service), kern::success);
+  const std::size_t before = openDescriptors();
+  EXPECT_GE(
+      refusalsOf([&] { return sources.makeRoutineSource(service, table, WantTrailer::yes) != nullptr; }), 2);
+  EXPECT_GE(refusalsOf([&] { return addNewSource(service); }), 1);
+  EXPECT_EQ(openDescriptors(), before);
+}
+
 TEST_F(ServiceTest, WithoutMemoryForAConnectionItIsClosedAndNothingOfItIsLeft) {
   if (!FailingAllocations::kWork) GTEST_SKIP() << "operator new belongs to the sanitizer";
   listen();
@@ -1893,6 +1963,7 @@ TEST_F(ServiceTest, WithoutMemoryForAConnectionItIsClosedAndNothingOfItIsLeft) {
       EXPECT_EQ(openDescriptors(), before + 1) << at;
       continue;
     }
+    EXPECT_EQ(failures, 0) << at << ": whoever is let in is counted";
     ASSERT_TRUE(sendTo(connection.get(), message(kEcho)));
     pump();
     EXPECT_TRUE(receiveFrom(connection.get())) << at;
@@ -2068,30 +2139,6 @@ TEST_F(ServiceTest, AnAdmittedConnectionIsNotGivenUpForOthers) {
   }
   EXPECT_FALSE(isClosed(admitted));
 }
-
-// Takes every descriptor that this process may have, and gives `count` back.
-class DescriptorShortage {
- public:
-  explicit DescriptorShortage(std::size_t count) {
-    ::getrlimit(RLIMIT_NOFILE, &before_);
-    const rlimit tight{std::min<rlim_t>(before_.rlim_max, 256), before_.rlim_max};
-    ::setrlimit(RLIMIT_NOFILE, &tight);
-    for (;;) {
-      UniqueFd filler(::dup(0));
-      if (!filler.isValid()) break;
-      fillers_.push_back(std::move(filler));
-    }
-    giveBack(count);
-  }
-  ~DescriptorShortage() { ::setrlimit(RLIMIT_NOFILE, &before_); }
-  DescriptorShortage(const DescriptorShortage&) = delete;
-  DescriptorShortage& operator=(const DescriptorShortage&) = delete;
-  void giveBack(std::size_t count) { fillers_.resize(fillers_.size() - count); }
-
- private:
-  rlimit before_{};
-  std::vector<UniqueFd> fillers_;
-};
 
 TEST_F(ServiceTest, WithoutDescriptorsACheckInIsAnsweredWith6AndALineAndNobodySpins) {
   listen();
