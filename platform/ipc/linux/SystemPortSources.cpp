@@ -211,6 +211,13 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
     if (owner != nullptr) owner->ended(*this);
   }
 
+  // Ends the channel after a reply that could not be sent: others may hold the socket, too, and whoever waits
+  // for that reply must see that it will not come.
+  void giveUp() noexcept {
+    if (fd_ != nullptr) (void)::shutdown(fd_->get(), SHUT_RDWR);
+    end();
+  }
+
   // Takes a message and serves it. True when one more may be taken in this turn.
   bool takeOne(Readiness readiness) noexcept {
     if (isDoor_ && !owner_->mayBeRead(*this)) {
@@ -238,7 +245,7 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
     pending_.reset();
     retry_.reset();
     if (sent == Sent::done && source_->setInterest(Interest::reading)) return true;
-    end();
+    giveUp();
     return false;
   }
 
@@ -252,7 +259,7 @@ class Channel : public std::enable_shared_from_this<Channel>, public ConnectionB
     if (retry_ != nullptr) return true;
     try {
       retry_ = loop_->addTimer(
-          kRetryPause, kRetryPause, [this] { ready({}); }, [this] { end(); });
+          kRetryPause, kRetryPause, [this] { ready({}); }, [this] { giveUp(); });
     } catch (const std::bad_alloc&) {
       return false;
     }
@@ -404,13 +411,13 @@ void Channel::answer(OutgoingReply& reply, bool wanted) noexcept {
   if (sent == Sent::done) return finish(reply);
   if (sent == Sent::failed) {
     finish(reply);
-    return end();
+    return giveUp();
   }
   retriesLeft_ = kMaxRetries;
   pending_.reset(new (std::nothrow) OutgoingReply(std::move(reply)));
   if (pending_ == nullptr || !waitToSend(sent)) {
     if (pending_ == nullptr) finish(reply);
-    end();
+    giveUp();
   }
 }
 

@@ -968,6 +968,38 @@ TEST_F(PlayedLoopTest, AReplyThatCannotBeSentEndsItsChannelAndNothingOfItIsLeft)
   }
 }
 
+TEST_F(PlayedLoopTest, AClientWhoseReplyCannotBeSentSeesTheEndOfItsChannelAndDoesNotWaitForever) {
+  const auto seesTheEnd = [&] {
+    char byte = 0;
+    return ::recv(client.get(), &byte, 1, MSG_DONTWAIT) == 0;
+  };
+  {
+    askForRegion();
+    const FailingCall tooMany("send", ETOOMANYREFS);
+    played.makeReady(fd, kReadable);
+  }
+  EXPECT_TRUE(seesTheEnd()) << "at once";
+
+  ASSERT_NO_FATAL_FAILURE(addClient());
+  askForRegion();
+  {
+    const FailingCall noMemory("send", ENOMEM, 0, FailingCall::HowOften::always);
+    played.makeReady(fd, kReadable);
+    EXPECT_FALSE(seesTheEnd());
+    for (int i = 0; i < 200; ++i) clock.advance(10ms);
+  }
+  EXPECT_TRUE(seesTheEnd()) << "after all tries";
+
+  ASSERT_NO_FATAL_FAILURE(addClient());
+  played.refuseTimers = true;
+  askForRegion();
+  {
+    const FailingCall noMemory("send", ENOMEM);
+    played.makeReady(fd, kReadable);
+  }
+  EXPECT_TRUE(seesTheEnd()) << "without a timer to try again";
+}
+
 TEST_F(PlayedLoopTest, AReplyThatWaitedAndCannotBeSentThenEndsItsChannel) {
   for (const bool waitsForMemory : {true, false}) {
     if (!waitsForMemory) fillChannel();
