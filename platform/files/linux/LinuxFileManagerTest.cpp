@@ -158,6 +158,25 @@ TEST_F(LinuxFileManagerTest, OwnersAreKeptWhereThatIsPermitted) {
   EXPECT_EQ(statOf(dir / "copy/file").st_uid, 4711u);
   EXPECT_EQ(statOf(dir / "copy/file").st_gid, 4712u);
   EXPECT_EQ(statOf(dir / "copy/file").st_mode & 07777, 04755u);
+  // Also where only one of the two is another's, in files and in folders.
+  const struct {
+    uid_t uid;
+    gid_t gid;
+  } owners[] = {{4711, ::getegid()}, {0, 4712}};
+  for (const auto& owner : owners) {
+    for (const char* const name : {"tree/file", "tree"}) {
+      ASSERT_EQ(::chown((dir / name).c_str(), owner.uid, owner.gid), 0);
+    }
+    dir.file("above/plain", "x");
+    std::filesystem::rename(dir / "tree", dir / "above/tree");
+    EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
+    EXPECT_EQ(copy("above", "copy"), kSuccess);
+    for (const char* const name : {"copy/tree", "copy/tree/file"}) {
+      EXPECT_EQ(statOf(dir / name).st_uid, owner.uid) << name;
+      EXPECT_EQ(statOf(dir / name).st_gid, owner.gid) << name;
+    }
+    std::filesystem::rename(dir / "above/tree", dir / "tree");
+  }
 }
 
 TEST_F(LinuxFileManagerTest, ATreesFilesOfThisUserKeepAllTheirModeBits) {
@@ -1147,6 +1166,32 @@ TEST_F(LinuxFileManagerTest, NamedOwnersAreLookedUp) {
   EXPECT_EQ(files.createDirectory(dir / "b", {0755, "", "no such group"}, Intermediates::mustExist),
             failure(EINVAL));
   EXPECT_FALSE(isThere(dir / "b"));
+}
+
+TEST_F(LinuxFileManagerTest, AnItemIsThereOrNotAndADirectoryOrNot) {
+  dir.file("tree/file", "x");
+  dir.link("to-tree", "tree");
+  dir.link("to-file", "tree/file");
+  dir.link("to-nothing", "missing");
+  const struct {
+    const char* name;
+    bool exists, isDirectory;
+  } items[] = {{"tree", true, true},
+               {"tree/", true, true},
+               {"tree/file", true, false},
+               {"to-tree", true, true},
+               {"to-tree/file", true, false},
+               {"to-file", true, false},
+               {"to-nothing", false, false},
+               {"missing", false, false},
+               {"missing/below", false, false},
+               {"tree/file/below", false, false}};
+  for (const auto& each : items) {
+    bool isDirectory = !each.isDirectory;
+    EXPECT_EQ(files.itemExists(dir / each.name, &isDirectory), each.exists) << each.name;
+    EXPECT_EQ(isDirectory, each.isDirectory) << each.name;
+    EXPECT_EQ(files.itemExists(dir / each.name, nullptr), each.exists) << each.name;
+  }
 }
 
 // ---- reading and writing

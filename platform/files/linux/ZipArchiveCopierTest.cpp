@@ -20,6 +20,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/files/archive/ArchiveFrames.h"
 #include "platform/files/fakes/ChildProcesses.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
@@ -330,6 +331,19 @@ TEST_F(ZipArchiveCopierTest, WithoutTheOptionsCompanionsAndAttributesAreLeftOut)
   EXPECT_FALSE(isThere(dir / "out/._name"));
   EXPECT_LT(::getxattr((dir / "out/name").c_str(), "user.note", nullptr, 0), 0);
   EXPECT_EQ(unpack(zip.build(), options(false)), ENOTSUP);
+}
+
+TEST_F(ZipArchiveCopierTest, AnAttributeThatComesTwiceHasItsLastValue) {
+  const auto directoryWith = [](const char* value) {
+    return entryFrame("d", 0, archive_frame::Kind::directory, "", 0755) +
+           frame(archive_frame::Type::companion, companionWith("note", value)) + kEndOfEntry;
+  };
+  const std::string frames = directoryWith("first") + directoryWith("last") + kEnd;
+  EXPECT_EQ(copy(dir.file("frames", frames), dir / "out", options(true, true, false), "/bin/cat"), 0);
+  char value[16];
+  const ssize_t size = ::getxattr((dir / "out/d").c_str(), "user.note", value, sizeof value);
+  if (size < 0 && errno == ENOTSUP) GTEST_SKIP() << "no attributes here";
+  EXPECT_EQ(std::string(value, static_cast<std::size_t>(std::max<ssize_t>(size, 0))), "last");
 }
 
 // ---- hostile archives
@@ -664,6 +678,39 @@ TEST_F(ZipArchiveCopierTest, KilledAtAnyMomentAFileIsTheOldOneOrTheNewOne) {
   for (const auto& entry : std::filesystem::directory_iterator(dir / "out")) {
     EXPECT_FALSE(entry.path().filename().string().starts_with(".brenvik")) << entry.path();
   }
+}
+
+TEST_F(ZipArchiveCopierTest, IntoADirectoryThatMayNotBeEnteredNothingIsUnpacked) {
+  const std::string frames =
+      dir.file("frames", entryFrame("closed", 0, archive_frame::Kind::directory, "", 0755) + kEndOfEntry +
+                             entryFrame("new") + kEndOfEntry + kEnd);
+  dir.directory("out/closed");
+  ASSERT_EQ(::chmod(dir.path().c_str(), 0777), 0);
+  ASSERT_EQ(::chmod((dir / "out").c_str(), 0777), 0);
+  ASSERT_EQ(::chmod((dir / "out/closed").c_str(), 0000), 0);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    if (::geteuid() == 0 && (::setresgid(4712, 4712, 4712) != 0 || ::setresuid(4711, 4711, 4711) != 0)) {
+      ::_exit(9);
+    }
+    EXPECT_EQ(copy(frames, dir / "out", options(), "/bin/cat"), EACCES);
+    EXPECT_EQ(fatal, EACCES);
+    std::fflush(nullptr);
+    ::_exit(HasFailure() ? 1 : 0);
+  }
+  int status = -1;
+  ::waitpid(child, &status, 0);
+  EXPECT_EQ(status, 0);
+  EXPECT_FALSE(isThere(dir / "out/new"));
+}
+
+TEST_F(ZipArchiveCopierTest, AFolderThatCannotBeMadeEndsTheCopyAndItsFilesStandNowhereElse) {
+  // The hidden folder and the stage in it come first.
+  const FailingCall broken("mkdirat", EIO, 2);
+  EXPECT_EQ(copyFrames(entryFrame("first") + kEndOfEntry + entryFrame("a/b/file") + kEndOfEntry + kEnd), EIO);
+  EXPECT_EQ(broken.failures(), 1);
+  EXPECT_EQ(fatal, EIO);
+  EXPECT_EQ(everything(), (std::set<std::string>{"frames"}));
 }
 
 TEST_F(ZipArchiveCopierTest, AsAnOrdinaryUserItWorksAsWell) {
