@@ -711,6 +711,18 @@ TEST_F(LeftoversTest, WhatALivingProcessWorksAtIsNotTouched) {
   EXPECT_EQ(contentOf(dir / "to/copy/file"), "x");
 }
 
+TEST_F(LeftoversTest, ARoomThatAnybodyElseMayEnterIsNoLeftover) {
+  const std::string room = dir.directory("folder/.brenvik-0123456789abcdef");
+  for (const mode_t mode : {0701u, 0702u, 0704u, 0710u, 0720u, 0740u}) {
+    ASSERT_EQ(::chmod(room.c_str(), mode), 0);
+    EXPECT_EQ(files.placeLink(dir / "folder/link", "target"), kSuccess);
+    EXPECT_TRUE(isThere(room)) << mode;
+  }
+  ASSERT_EQ(::chmod(room.c_str(), 0700), 0);
+  EXPECT_EQ(files.placeLink(dir / "folder/link", "target"), kSuccess);
+  EXPECT_FALSE(isThere(room));
+}
+
 TEST_F(LeftoversTest, WhatAStrangerMadeUnderSuchANameIsNeverRemoved) {
   const std::string left = leaveOne("to");
   std::filesystem::remove_all(dir / ("to/" + left));
@@ -1218,6 +1230,31 @@ TEST_F(LinuxFileManagerTest, AnAtomicWriteReplacesALinkAndNotItsTarget) {
   EXPECT_FALSE(files.writeFileAtomically(dir / "no/such", "x"));
   EXPECT_FALSE(files.writeFileAtomically(dir.directory("directory"), "x"));
   EXPECT_EQ(names(""), (std::vector<std::string>{"directory", "fresh", "link", "precious"}));
+}
+
+TEST_F(LinuxFileManagerTest, AnAtomicWriteKeepsTheModeAndTheOwnerButNoSetIdBit) {
+  const std::string file = dir.file("file", "old");
+  ASSERT_EQ(::chmod(file.c_str(), 06751), 0);
+  EXPECT_TRUE(files.writeFileAtomically(file, "new"));
+  EXPECT_EQ(statOf(file).st_mode & 07777, 0751u);
+  if (::geteuid() != 0) return;
+  ASSERT_EQ(::chown(file.c_str(), 4713, 4714), 0);
+  EXPECT_TRUE(files.writeFileAtomically(file, "newer"));
+  EXPECT_EQ(statOf(file).st_uid, 4713u);
+  EXPECT_EQ(statOf(file).st_gid, 4714u);
+  EXPECT_EQ(statOf(file).st_mode & 07777, 0751u);
+  // Who cannot give it to its owner keeps it for himself: the mode spoke of others.
+  ASSERT_EQ(::chmod(dir.path().c_str(), 0777), 0);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    if (::setresgid(4712, 4712, 4712) != 0 || ::setresuid(4711, 4711, 4711) != 0) ::_exit(9);
+    ::_exit(files.writeFileAtomically(file, "theirs") ? 0 : 1);
+  }
+  int status = -1;
+  ::waitpid(child, &status, 0);
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(statOf(file).st_uid, 4711u);
+  EXPECT_EQ(statOf(file).st_mode & 07777, 0700u);
 }
 
 TEST_F(LinuxFileManagerTest, AWriteInPlaceRefusesALinkAndDoesNotWaitForAReader) {

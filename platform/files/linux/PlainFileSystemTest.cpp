@@ -249,6 +249,17 @@ TEST_F(PlainFileSystemTest, WhatTheKernelCannotCopyIsReadAndWrittenAndAnyOtherFa
   }
 }
 
+TEST_F(PlainFileSystemTest, AKernelThatCannotCopyIsAskedOncePerTree) {
+  const std::string content(200'000, 'c');
+  for (const char* const name : {"tree/a", "tree/b", "tree/c"}) dir.file(name, content);
+  const FailingCall clone("ioctl(FICLONE)", EOPNOTSUPP, 0, kAlways);
+  const FailingCall range("copy_file_range", ENOSYS, 0, kAlways);
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  EXPECT_EQ(clone.failures(), 1);
+  EXPECT_EQ(range.failures(), 1);
+  for (const char* const name : {"copy/a", "copy/b", "copy/c"}) EXPECT_TRUE(contentOf(dir / name) == content);
+}
+
 TEST_F(PlainFileSystemTest, AnAttributeThatTheDiskCannotTakeEndsTheCopyAndOneThatItDoesNotKnowDoesNot) {
   const std::string source = dir.file("source", "x");
   if (::setxattr(source.c_str(), "user.note", "value", 5, 0) != 0) GTEST_SKIP() << "no attributes here";

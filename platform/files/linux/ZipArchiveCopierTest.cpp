@@ -333,6 +333,17 @@ TEST_F(ZipArchiveCopierTest, WithoutTheOptionsCompanionsAndAttributesAreLeftOut)
   EXPECT_EQ(unpack(zip.build(), options(false)), ENOTSUP);
 }
 
+TEST_F(ZipArchiveCopierTest, ACompanionCannotBeRunAndALinkHasNone) {
+  const std::string companion = frame(archive_frame::Type::companion, "resource");
+  EXPECT_EQ(
+      copyFrames(entryFrame("name", 0, archive_frame::Kind::file, "", 0755) + companion + kEndOfEntry +
+                 entryFrame("link", 0, archive_frame::Kind::link, "name") + companion + kEndOfEntry + kEnd),
+      0);
+  EXPECT_EQ(everything(), (std::set<std::string>{"frames", "out", "out/name", "out/._name", "out/link"}));
+  EXPECT_EQ(statOf(dir / "out/name").st_mode & 07777, 0755u);
+  EXPECT_EQ(statOf(dir / "out/._name").st_mode & 07777, 0644u);
+}
+
 TEST_F(ZipArchiveCopierTest, AnAttributeThatComesTwiceHasItsLastValue) {
   const auto directoryWith = [](const char* value) {
     return entryFrame("d", 0, archive_frame::Kind::directory, "", 0755) +
@@ -532,6 +543,22 @@ TEST_F(ZipArchiveCopierTest, MoreBytesThanTheCapAreRefusedBeforeTheFirst) {
   EXPECT_EQ(copyFrames(entryFrame("bomb", (std::uint64_t{1} << 30) + 1)), EFBIG);
   EXPECT_EQ(fatal, EFBIG);
   EXPECT_EQ(everything(), (std::set<std::string>{"frames"}));
+}
+
+TEST_F(ZipArchiveCopierTest, CompanionsCountAsWellEvenWhereTheyAreLeftOut) {
+  dir.directory("disk");
+  const auto framesWith = [&](std::size_t bytes) {
+    return dir.file("frames", entryFrame("a") +
+                                  frame(archive_frame::Type::companion, std::string(bytes, 'c')) +
+                                  kEndOfEntry + kEnd);
+  };
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 128);
+    const PropertyList dataOnly = options(true, false, false);
+    EXPECT_EQ(copy(framesWith(200'000), dir / "disk/out", dataOnly, "/bin/cat"), EFBIG);
+    EXPECT_TRUE(std::filesystem::is_empty(dir / "disk"));
+    EXPECT_EQ(copy(framesWith(20'000), dir / "disk/out", dataOnly, "/bin/cat"), 0);
+  });
 }
 
 TEST_F(ZipArchiveCopierTest, MoreEntriesThanTheCapAreRefused) {
