@@ -82,6 +82,11 @@ TEST(ResourceCompanionTest, TheEntryMayStandBehindOthersAndOnlyTheFirstOneCounts
   EXPECT_EQ(extendedAttributesOf(headWith({{kAttributes, 50, 0}, {kAttributes, second, 0}}) + first +
                                  blockAt(second, {{"o", "w"}})),
             (Attributes{{"n", "v"}}));
+  // Behind the count there is none.
+  std::string fewer = headWith({{kResourceFork, 3, 5}, {kAttributes, 50, 0}}) + first;
+  ASSERT_EQ(fewer[25], 2);
+  fewer[25] = 1;
+  EXPECT_EQ(extendedAttributesOf(fewer), Attributes{});
   // One that lies beyond the end is none.
   EXPECT_EQ(extendedAttributesOf(headWith({{kAttributes, 0xFFFFFFFF, 0}, {kAttributes, 50, 0}}) + first),
             (Attributes{{"n", "v"}}));
@@ -96,6 +101,14 @@ TEST(ResourceCompanionTest, OfACompanionThatIsCutOffAnywhereOnlyWholeAttributesC
     const Attributes expected = length < all.size() - 2 ? Attributes{} : Attributes{{"first", "1"}};
     EXPECT_EQ(found, expected) << length;
   }
+}
+
+TEST(ResourceCompanionTest, ANameMayEndWhereTheCompanionEnds) {
+  std::string all = companion({{"none", ""}});
+  all.resize(108 + 11 + 5);
+  EXPECT_EQ(extendedAttributesOf(all), (Attributes{{"none", ""}}));
+  all.pop_back();
+  EXPECT_EQ(extendedAttributesOf(all), Attributes{});
 }
 
 TEST(ResourceCompanionTest, WithoutItsMarksItHasNone) {

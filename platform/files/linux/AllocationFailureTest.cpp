@@ -5,8 +5,11 @@
 // ENOMEM and leave nothing, and in the archive reader, which may die of it.
 // Not under ThreadSanitizer, which has operator new to itself.
 #ifndef __SANITIZE_THREAD__
+#include <dirent.h>
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -19,9 +22,12 @@
 #include <set>
 #include <string>
 
+#include "platform/base/UniqueFd.h"
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/files/fakes/ZipBuilder.h"
 #include "platform/files/linux/LinuxFileManager.h"
+#include "platform/files/linux/TreeRemover.h"
 #include "platform/files/linux/ZipArchiveCopier.h"
 
 namespace {
@@ -51,6 +57,20 @@ bool failsNow() {
 }
 [[gnu::noinline]] void operator delete(void* block) noexcept { std::free(block); }
 [[gnu::noinline]] void operator delete(void* block, std::size_t) noexcept { std::free(block); }
+
+// Of each listing only the first entries are shown: one file at least.
+static bool cutsListings = false;  // NOLINT
+extern "C" ssize_t getdents64(int directory, void* entries, std::size_t size) noexcept {
+  const bool isFirst = ::lseek(directory, 0, SEEK_CUR) == 0;
+  if (cutsListings && !isFirst) return 0;
+  const ssize_t all = ::syscall(SYS_getdents64, directory, entries, size);
+  if (!cutsListings) return all;
+  ssize_t shown = 0;
+  for (int i = 0; i < 3 && shown < all; ++i) {
+    shown += reinterpret_cast<const dirent64*>(static_cast<const char*>(entries) + shown)->d_reclen;
+  }
+  return shown;
+}
 
 namespace brenvik {
 namespace {
@@ -131,6 +151,43 @@ TEST_P(AllocationFailureTest, ARemovalThatLacksMemoryCanBeRepeated) {
       ASSERT_EQ(files.removeItem(tree), FileOutcome::success()) << number;
     }
   }
+}
+
+class RemovalWithoutMemoryTest : public testing::Test {
+ protected:
+  RemovalWithoutMemoryTest() {
+    for (int i = 0; i < 12; ++i) dir.file("tree/" + std::to_string(i));
+  }
+  // Nothing can be allocated from its first moment on.
+  int remove() {
+    const UniqueFd folder(::open(dir.path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    int error = 0;
+    withFailure(0, Which::allFromThere, [&] { error = removeTree(folder.get(), "tree"); });
+    return error;
+  }
+
+  TemporaryDirectory dir;
+};
+
+TEST_F(RemovalWithoutMemoryTest, WhatAListingDidNotShowIsRemovedWithTheNextOne) {
+  cutsListings = true;
+  EXPECT_EQ(remove(), 0);
+  cutsListings = false;
+  EXPECT_FALSE(isThere(dir / "tree"));
+}
+
+TEST_F(RemovalWithoutMemoryTest, WhatCannotBeRemovedIsTheAnswerAndTheRestGoes) {
+  {
+    // The first two calls are for the directory itself, before and after memory was missed.
+    const FailingCall stuck("unlinkat of no directory", EBUSY, 5, FailingCall::HowOften::always);
+    EXPECT_EQ(remove(), EBUSY);
+  }
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir / "tree"), {}), 9);
+  // One that somebody else removes meanwhile is no failure.
+  const FailingCall gone("unlinkat of no directory", ENOENT, 3);
+  EXPECT_EQ(remove(), 0);
+  EXPECT_EQ(gone.failures(), 1);
+  EXPECT_FALSE(isThere(dir / "tree"));
 }
 
 TEST_P(AllocationFailureTest, WritesAndDirectoriesAreThereOrNot) {

@@ -158,6 +158,25 @@ TEST_F(LinuxFileManagerTest, OwnersAreKeptWhereThatIsPermitted) {
   EXPECT_EQ(statOf(dir / "copy/file").st_uid, 4711u);
   EXPECT_EQ(statOf(dir / "copy/file").st_gid, 4712u);
   EXPECT_EQ(statOf(dir / "copy/file").st_mode & 07777, 04755u);
+  // Also where only one of the two is another's, in files and in folders.
+  const struct {
+    uid_t uid;
+    gid_t gid;
+  } owners[] = {{4711, ::getegid()}, {0, 4712}};
+  for (const auto& owner : owners) {
+    for (const char* const name : {"tree/file", "tree"}) {
+      ASSERT_EQ(::chown((dir / name).c_str(), owner.uid, owner.gid), 0);
+    }
+    dir.file("above/plain", "x");
+    std::filesystem::rename(dir / "tree", dir / "above/tree");
+    EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
+    EXPECT_EQ(copy("above", "copy"), kSuccess);
+    for (const char* const name : {"copy/tree", "copy/tree/file"}) {
+      EXPECT_EQ(statOf(dir / name).st_uid, owner.uid) << name;
+      EXPECT_EQ(statOf(dir / name).st_gid, owner.gid) << name;
+    }
+    std::filesystem::rename(dir / "above/tree", dir / "tree");
+  }
 }
 
 TEST_F(LinuxFileManagerTest, ATreesFilesOfThisUserKeepAllTheirModeBits) {
@@ -692,6 +711,18 @@ TEST_F(LeftoversTest, WhatALivingProcessWorksAtIsNotTouched) {
   EXPECT_EQ(contentOf(dir / "to/copy/file"), "x");
 }
 
+TEST_F(LeftoversTest, ARoomThatAnybodyElseMayEnterIsNoLeftover) {
+  const std::string room = dir.directory("folder/.brenvik-0123456789abcdef");
+  for (const mode_t mode : {0701u, 0702u, 0704u, 0710u, 0720u, 0740u}) {
+    ASSERT_EQ(::chmod(room.c_str(), mode), 0);
+    EXPECT_EQ(files.placeLink(dir / "folder/link", "target"), kSuccess);
+    EXPECT_TRUE(isThere(room)) << mode;
+  }
+  ASSERT_EQ(::chmod(room.c_str(), 0700), 0);
+  EXPECT_EQ(files.placeLink(dir / "folder/link", "target"), kSuccess);
+  EXPECT_FALSE(isThere(room));
+}
+
 TEST_F(LeftoversTest, WhatAStrangerMadeUnderSuchANameIsNeverRemoved) {
   const std::string left = leaveOne("to");
   std::filesystem::remove_all(dir / ("to/" + left));
@@ -1149,6 +1180,32 @@ TEST_F(LinuxFileManagerTest, NamedOwnersAreLookedUp) {
   EXPECT_FALSE(isThere(dir / "b"));
 }
 
+TEST_F(LinuxFileManagerTest, AnItemIsThereOrNotAndADirectoryOrNot) {
+  dir.file("tree/file", "x");
+  dir.link("to-tree", "tree");
+  dir.link("to-file", "tree/file");
+  dir.link("to-nothing", "missing");
+  const struct {
+    const char* name;
+    bool exists, isDirectory;
+  } items[] = {{"tree", true, true},
+               {"tree/", true, true},
+               {"tree/file", true, false},
+               {"to-tree", true, true},
+               {"to-tree/file", true, false},
+               {"to-file", true, false},
+               {"to-nothing", false, false},
+               {"missing", false, false},
+               {"missing/below", false, false},
+               {"tree/file/below", false, false}};
+  for (const auto& each : items) {
+    bool isDirectory = !each.isDirectory;
+    EXPECT_EQ(files.itemExists(dir / each.name, &isDirectory), each.exists) << each.name;
+    EXPECT_EQ(isDirectory, each.isDirectory) << each.name;
+    EXPECT_EQ(files.itemExists(dir / each.name, nullptr), each.exists) << each.name;
+  }
+}
+
 // ---- reading and writing
 
 TEST_F(LinuxFileManagerTest, ReadingStopsAtTheLimitAndNeverWaits) {
@@ -1173,6 +1230,31 @@ TEST_F(LinuxFileManagerTest, AnAtomicWriteReplacesALinkAndNotItsTarget) {
   EXPECT_FALSE(files.writeFileAtomically(dir / "no/such", "x"));
   EXPECT_FALSE(files.writeFileAtomically(dir.directory("directory"), "x"));
   EXPECT_EQ(names(""), (std::vector<std::string>{"directory", "fresh", "link", "precious"}));
+}
+
+TEST_F(LinuxFileManagerTest, AnAtomicWriteKeepsTheModeAndTheOwnerButNoSetIdBit) {
+  const std::string file = dir.file("file", "old");
+  ASSERT_EQ(::chmod(file.c_str(), 06751), 0);
+  EXPECT_TRUE(files.writeFileAtomically(file, "new"));
+  EXPECT_EQ(statOf(file).st_mode & 07777, 0751u);
+  if (::geteuid() != 0) return;
+  ASSERT_EQ(::chown(file.c_str(), 4713, 4714), 0);
+  EXPECT_TRUE(files.writeFileAtomically(file, "newer"));
+  EXPECT_EQ(statOf(file).st_uid, 4713u);
+  EXPECT_EQ(statOf(file).st_gid, 4714u);
+  EXPECT_EQ(statOf(file).st_mode & 07777, 0751u);
+  // Who cannot give it to its owner keeps it for himself: the mode spoke of others.
+  ASSERT_EQ(::chmod(dir.path().c_str(), 0777), 0);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    if (::setresgid(4712, 4712, 4712) != 0 || ::setresuid(4711, 4711, 4711) != 0) ::_exit(9);
+    ::_exit(files.writeFileAtomically(file, "theirs") ? 0 : 1);
+  }
+  int status = -1;
+  ::waitpid(child, &status, 0);
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(statOf(file).st_uid, 4711u);
+  EXPECT_EQ(statOf(file).st_mode & 07777, 0700u);
 }
 
 TEST_F(LinuxFileManagerTest, AWriteInPlaceRefusesALinkAndDoesNotWaitForAReader) {

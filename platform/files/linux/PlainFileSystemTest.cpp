@@ -5,11 +5,16 @@
 // open file. The calls are refused here, because no such file system is to be had everywhere. And disks that
 // do not keep what they were given, processes that are killed between two calls, and strangers who rename
 // between two calls.
+#include <dlfcn.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -76,6 +81,42 @@ extern "C" int syncfs(int file) noexcept {
   if (brenvik::FailingCall::failsNow("syncfs")) return -1;
   return static_cast<int>(::syscall(SYS_syncfs, file));
 }
+extern "C" ssize_t copy_file_range(int from, off64_t* fromOffset, int to, off64_t* toOffset, std::size_t size,
+                                   unsigned flags) {
+  if (brenvik::FailingCall::failsNow("copy_file_range")) return -1;
+  return ::syscall(SYS_copy_file_range, from, fromOffset, to, toOffset, size, flags);
+}
+extern "C" int ioctl(int file, unsigned long request, ...) noexcept {
+  va_list arguments;
+  va_start(arguments, request);
+  const unsigned long argument = va_arg(arguments, unsigned long);
+  va_end(arguments);
+  if (request == FICLONE && brenvik::FailingCall::failsNow("ioctl(FICLONE)")) return -1;
+  return static_cast<int>(::syscall(SYS_ioctl, file, request, argument));
+}
+extern "C" int fsetxattr(int file, const char* name, const void* value, std::size_t size,
+                         int flags) noexcept {
+  if (brenvik::FailingCall::failsNow("fsetxattr")) return -1;
+  return static_cast<int>(::syscall(SYS_fsetxattr, file, name, value, size, flags));
+}
+extern "C" int unlinkat(int folder, const char* name, int flags) noexcept {
+  if (flags == 0 && brenvik::FailingCall::failsNow("unlinkat of no directory")) return -1;
+  return static_cast<int>(::syscall(SYS_unlinkat, folder, name, flags));
+}
+extern "C" int mkdirat(int folder, const char* name, mode_t mode) noexcept {
+  if (brenvik::FailingCall::failsNow("mkdirat")) return -1;
+  return static_cast<int>(::syscall(SYS_mkdirat, folder, name, mode));
+}
+extern "C" int fchmod(int file, mode_t mode) noexcept {
+  if (brenvik::FailingCall::failsNow("fchmod")) return -1;
+  return static_cast<int>(::syscall(SYS_fchmod, file, mode));
+}
+extern "C" int fchmodat(int folder, const char* name, mode_t mode, int flags) noexcept {
+  if (brenvik::FailingCall::failsNow("fchmodat")) return -1;
+  // Not every kernel has a call that knows the flags.
+  static const auto next = reinterpret_cast<decltype(&fchmodat)>(::dlsym(RTLD_NEXT, "fchmodat"));
+  return next(folder, name, mode, flags);
+}
 
 namespace brenvik {
 namespace {
@@ -118,6 +159,16 @@ TEST_F(PlainFileSystemTest, WithoutUnnamedFilesACopyIsMadeUnderAHiddenNameOfWhic
     EXPECT_EQ(unknown.failures(), 2);
     EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
   }
+}
+
+TEST_F(PlainFileSystemTest, WithoutUnnamedFilesAnAtomicWriteStillReplacesNoDirectory) {
+  const FailingCall unknown("openat(O_TMPFILE)", EOPNOTSUPP, 0, kAlways);
+  dir.directory("directory");
+  EXPECT_FALSE(files.writeFileAtomically(dir / "directory", "new"));
+  EXPECT_EQ(names(), (Names{"directory"}));
+  dir.file("file", "old");
+  EXPECT_TRUE(files.writeFileAtomically(dir / "file", "new"));
+  EXPECT_EQ(contentOf(dir / "file"), "new");
 }
 
 TEST_F(PlainFileSystemTest, AnyOtherRefusalOfAnUnnamedFileIsTheCopysFailure) {
@@ -173,6 +224,120 @@ TEST_F(PlainFileSystemTest, AnOpenFileThatMayNotBeLinkedIsLinkedByItsPathInProc)
   EXPECT_EQ(copy("source", "old", IfPresent::replaceNonDirectory), kSuccess);
   EXPECT_EQ(contentOf(dir / "old"), "new");
   EXPECT_EQ(names(), (Names{"copy", "old", "source"}));
+}
+
+TEST_F(PlainFileSystemTest, WhatTheKernelCannotCopyIsReadAndWrittenAndAnyOtherFailureIsTheCopys) {
+  // Too long to be read at once, too short for a mapping.
+  const std::string content(200'000, 'c');
+  dir.file("source", content);
+  const auto expectAfter = [&](int cloning, int copying, const FileOutcome& expected) {
+    const FailingCall clone("ioctl(FICLONE)", cloning);
+    const FailingCall range("copy_file_range", copying);
+    EXPECT_EQ(copy("source", "copy"), expected) << cloning << ", " << copying;
+    EXPECT_EQ(clone.failures(), 1);
+    if (expected.succeeded()) {
+      EXPECT_EQ(range.failures(), 1);
+      EXPECT_TRUE(contentOf(dir / "copy") == content) << cloning << ", " << copying;
+      EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
+    }
+    EXPECT_EQ(names(), (Names{"source"}));
+  };
+  for (const int unsupported : {EXDEV, EINVAL, ENOSYS, EOPNOTSUPP, ENOTTY, EPERM, ETXTBSY}) {
+    expectAfter(unsupported, unsupported, kSuccess);
+  }
+  expectAfter(EXDEV, EINTR, kSuccess);
+  for (const int other : {EIO, ENOSPC, EDQUOT, EFBIG}) {
+    expectAfter(other, EXDEV, FileOutcome::failure(other));
+    expectAfter(EXDEV, other, FileOutcome::failure(other));
+  }
+}
+
+TEST_F(PlainFileSystemTest, AKernelThatCannotCopyIsAskedOncePerTree) {
+  const std::string content(200'000, 'c');
+  for (const char* const name : {"tree/a", "tree/b", "tree/c"}) dir.file(name, content);
+  const FailingCall clone("ioctl(FICLONE)", EOPNOTSUPP, 0, kAlways);
+  const FailingCall range("copy_file_range", ENOSYS, 0, kAlways);
+  EXPECT_EQ(copy("tree", "copy"), kSuccess);
+  EXPECT_EQ(clone.failures(), 1);
+  EXPECT_EQ(range.failures(), 1);
+  for (const char* const name : {"copy/a", "copy/b", "copy/c"}) EXPECT_TRUE(contentOf(dir / name) == content);
+}
+
+TEST_F(PlainFileSystemTest, AnAttributeThatTheDiskCannotTakeEndsTheCopyAndOneThatItDoesNotKnowDoesNot) {
+  const std::string source = dir.file("source", "x");
+  if (::setxattr(source.c_str(), "user.note", "value", 5, 0) != 0) GTEST_SKIP() << "no attributes here";
+  for (const int error : {ENOSPC, EDQUOT, EIO}) {
+    const FailingCall full("fsetxattr", error);
+    EXPECT_EQ(copy("source", "copy"), FileOutcome::failure(error));
+    EXPECT_EQ(names(), (Names{"source"}));
+  }
+  for (const int error : {ENOTSUP, EPERM, EACCES, E2BIG}) {
+    const FailingCall unknown("fsetxattr", error);
+    EXPECT_EQ(copy("source", "copy"), kSuccess) << error;
+    EXPECT_EQ(unknown.failures(), 1);
+    EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
+  }
+}
+
+TEST_F(PlainFileSystemTest, APipeWhoseModeCannotBeSetIsNotCopied) {
+  ASSERT_EQ(::mkfifo((dir / "pipe").c_str(), 0640), 0);
+  const FailingCall broken("fchmodat", EIO);
+  EXPECT_EQ(copy("pipe", "copy"), FileOutcome::failure(EIO));
+  EXPECT_EQ(names(), (Names{"pipe"}));
+}
+
+TEST_F(PlainFileSystemTest, AnOrdinaryUsersClosedDirectoryIsOpenOnlyUntilItHasItsName) {
+  ASSERT_EQ(::chmod(dir.path().c_str(), 0777), 0);
+  dir.directory("closed");
+  ASSERT_EQ(::chmod((dir / "closed").c_str(), 0555), 0);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    if (::geteuid() == 0 && (::setresgid(4712, 4712, 4712) != 0 || ::setresuid(4711, 4711, 4711) != 0)) {
+      ::_exit(9);
+    }
+    EXPECT_EQ(copy("closed", "copy"), kSuccess);
+    EXPECT_EQ(statOf(dir / "copy").st_mode & 07777, 0555u);
+    {
+      // The copy's own mode comes first, then the opening.
+      const FailingCall broken("fchmod", EIO, 1);
+      EXPECT_EQ(copy("closed", "second"), FileOutcome::failure(EIO));
+      EXPECT_EQ(names(), (Names{"closed", "copy"}));
+    }
+    const FailingCall broken("fchmod", EIO, 2);
+    EXPECT_EQ(copy("closed", "second"), FileOutcome::failure(EIO));
+    EXPECT_EQ(broken.failures(), 1);
+    std::fflush(nullptr);
+    ::_exit(HasFailure() ? 1 : 0);
+  }
+  int status = -1;
+  ::waitpid(child, &status, 0);
+  EXPECT_EQ(status, 0);
+}
+
+TEST_F(PlainFileSystemTest, ADescriptorThatIsZeroIsAsGoodAsAnyOther) {
+  dir.file("tree/sub/file", "x");
+  const pid_t child = ::fork();
+  if (child == 0) {
+    int wanted = 0;
+    for (int opened = 1; opened > wanted; ++wanted) {
+      opened = 0;
+      beforeOpening = [&](const char*) {
+        if (opened++ == wanted) ::close(STDIN_FILENO);
+      };
+      EXPECT_EQ(copy("tree", "copy"), kSuccess) << wanted;
+      beforeOpening = nullptr;
+      EXPECT_EQ(contentOf(dir / "copy/sub/file"), "x") << wanted;
+      EXPECT_EQ(files.removeItem(dir / "copy"), kSuccess);
+      EXPECT_TRUE(::fcntl(STDIN_FILENO, F_GETFD) == -1 || opened <= wanted) << "is still open";
+      (void)::open("/dev/null", O_RDONLY | O_CLOEXEC);
+    }
+    EXPECT_GT(wanted, 5);
+    std::fflush(nullptr);
+    ::_exit(HasFailure() ? 1 : 0);
+  }
+  int status = -1;
+  ::waitpid(child, &status, 0);
+  EXPECT_EQ(status, 0);
 }
 
 // ---- killed between two calls
@@ -307,6 +472,29 @@ TEST_F(PlainFileSystemTest, AMoveAcrossWhoseCopyDoesNotReachTheDiskKeepsTheSourc
     EXPECT_EQ(broken.failures(), 1);
     EXPECT_EQ(contentOf(dir / "disk/single"), "s");
     EXPECT_EQ(names(), (Names{"disk"}));
+  });
+}
+
+TEST_F(PlainFileSystemTest, AMoveAwayFromAFullDiskTellsWhatItCouldNotFinish) {
+  dir.directory("disk");
+  inPrivateMounts([&] {
+    ASSERT_EQ(::mount("tmpfs", (dir / "disk").c_str(), "tmpfs", 0, "nr_inodes=3"), 0);
+    dir.file("disk/first", "x");
+    dir.file("disk/second", "y");
+    ASSERT_EQ(::mkdir((dir / "disk/no-more").c_str(), 0700), -1);
+    {
+      const FailingCall stuck("unlinkat of no directory", EIO);
+      EXPECT_EQ(move("disk/first", "moved"), FileOutcome::failure(EIO));
+      EXPECT_EQ(stuck.failures(), 1);
+      EXPECT_EQ(contentOf(dir / "disk/first"), "x");
+      EXPECT_EQ(files.removeItem(dir / "moved"), kSuccess);
+    }
+    // The file, its new name, and then the name that went.
+    const FailingCall broken("fsync", EIO, 2);
+    EXPECT_EQ(move("disk/first", "moved"), FileOutcome::failure(EIO));
+    EXPECT_EQ(broken.failures(), 1);
+    EXPECT_EQ(contentOf(dir / "moved"), "x");
+    EXPECT_FALSE(isThere(dir / "disk/first"));
   });
 }
 

@@ -348,6 +348,30 @@ TEST_F(ZipArchiveCopierTest, WithoutTheOptionsCompanionsAndAttributesAreLeftOut)
   EXPECT_EQ(unpack(zip.build(), options(false)), ENOTSUP);
 }
 
+TEST_F(ZipArchiveCopierTest, ACompanionCannotBeRunAndALinkHasNone) {
+  const std::string companion = frame(archive_frame::Type::companion, "resource");
+  EXPECT_EQ(
+      copyFrames(entryFrame("name", 0, archive_frame::Kind::file, "", 0755) + companion + kEndOfEntry +
+                 entryFrame("link", 0, archive_frame::Kind::link, "name") + companion + kEndOfEntry + kEnd),
+      0);
+  EXPECT_EQ(everything(), (std::set<std::string>{"frames", "out", "out/name", "out/._name", "out/link"}));
+  EXPECT_EQ(statOf(dir / "out/name").st_mode & 07777, 0755u);
+  EXPECT_EQ(statOf(dir / "out/._name").st_mode & 07777, 0644u);
+}
+
+TEST_F(ZipArchiveCopierTest, AnAttributeThatComesTwiceHasItsLastValue) {
+  const auto directoryWith = [](const char* value) {
+    return entryFrame("d", 0, archive_frame::Kind::directory, "", 0755) +
+           frame(archive_frame::Type::companion, companionWith("note", value)) + kEndOfEntry;
+  };
+  const std::string frames = directoryWith("first") + directoryWith("last") + kEnd;
+  EXPECT_EQ(copy(dir.file("frames", frames), dir / "out", options(true, true, false), "/bin/cat"), 0);
+  char value[16];
+  const ssize_t size = ::getxattr((dir / "out/d").c_str(), "user.note", value, sizeof value);
+  if (size < 0 && errno == ENOTSUP) GTEST_SKIP() << "no attributes here";
+  EXPECT_EQ(std::string(value, static_cast<std::size_t>(std::max<ssize_t>(size, 0))), "last");
+}
+
 // ---- hostile archives
 
 struct Hostile {
@@ -536,6 +560,22 @@ TEST_F(ZipArchiveCopierTest, MoreBytesThanTheCapAreRefusedBeforeTheFirst) {
   EXPECT_EQ(everything(), (std::set<std::string>{"frames"}));
 }
 
+TEST_F(ZipArchiveCopierTest, CompanionsCountAsWellEvenWhereTheyAreLeftOut) {
+  dir.directory("disk");
+  const auto framesWith = [&](std::size_t bytes) {
+    return dir.file("frames", entryFrame("a") +
+                                  frame(archive_frame::Type::companion, std::string(bytes, 'c')) +
+                                  kEndOfEntry + kEnd);
+  };
+  inPrivateMounts([&] {
+    mountSmallDisk(dir / "disk", 128);
+    const PropertyList dataOnly = options(true, false, false);
+    EXPECT_EQ(copy(framesWith(200'000), dir / "disk/out", dataOnly, "/bin/cat"), EFBIG);
+    EXPECT_TRUE(std::filesystem::is_empty(dir / "disk"));
+    EXPECT_EQ(copy(framesWith(20'000), dir / "disk/out", dataOnly, "/bin/cat"), 0);
+  });
+}
+
 TEST_F(ZipArchiveCopierTest, MoreEntriesThanTheCapAreRefused) {
   std::string frames;
   const std::string one = frame(archive_frame::Type::refused, std::string("\1\0\0\0x", 5));
@@ -680,6 +720,39 @@ TEST_F(ZipArchiveCopierTest, KilledAtAnyMomentAFileIsTheOldOneOrTheNewOne) {
   for (const auto& entry : std::filesystem::directory_iterator(dir / "out")) {
     EXPECT_FALSE(entry.path().filename().string().starts_with(".brenvik")) << entry.path();
   }
+}
+
+TEST_F(ZipArchiveCopierTest, IntoADirectoryThatMayNotBeEnteredNothingIsUnpacked) {
+  const std::string frames =
+      dir.file("frames", entryFrame("closed", 0, archive_frame::Kind::directory, "", 0755) + kEndOfEntry +
+                             entryFrame("new") + kEndOfEntry + kEnd);
+  dir.directory("out/closed");
+  ASSERT_EQ(::chmod(dir.path().c_str(), 0777), 0);
+  ASSERT_EQ(::chmod((dir / "out").c_str(), 0777), 0);
+  ASSERT_EQ(::chmod((dir / "out/closed").c_str(), 0000), 0);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    if (::geteuid() == 0 && (::setresgid(4712, 4712, 4712) != 0 || ::setresuid(4711, 4711, 4711) != 0)) {
+      ::_exit(9);
+    }
+    EXPECT_EQ(copy(frames, dir / "out", options(), "/bin/cat"), EACCES);
+    EXPECT_EQ(fatal, EACCES);
+    std::fflush(nullptr);
+    ::_exit(HasFailure() ? 1 : 0);
+  }
+  int status = -1;
+  ::waitpid(child, &status, 0);
+  EXPECT_EQ(status, 0);
+  EXPECT_FALSE(isThere(dir / "out/new"));
+}
+
+TEST_F(ZipArchiveCopierTest, AFolderThatCannotBeMadeEndsTheCopyAndItsFilesStandNowhereElse) {
+  // The hidden folder and the stage in it come first.
+  const FailingCall broken("mkdirat", EIO, 2);
+  EXPECT_EQ(copyFrames(entryFrame("first") + kEndOfEntry + entryFrame("a/b/file") + kEndOfEntry + kEnd), EIO);
+  EXPECT_EQ(broken.failures(), 1);
+  EXPECT_EQ(fatal, EIO);
+  EXPECT_EQ(everything(), (std::set<std::string>{"frames"}));
 }
 
 TEST_F(ZipArchiveCopierTest, AsAnOrdinaryUserItWorksAsWell) {
