@@ -700,6 +700,21 @@ TEST_F(CurlWebClientTest, ARedirectToHttpsIsFollowedAbsoluteOrRelative) {
   EXPECT_EQ(textOf(*fetch(server.url("/here/from"))), "relative");
 }
 
+TEST_F(CurlWebClientTest, FiveStatusesAreRedirectsAndNoOtherIs) {
+  HttpsServer server(identity, [](Connection& connection) {
+    const auto request = connection.readRequest();
+    if (request.starts_with("GET /target ")) return connection.respond("200 OK", "arrived");
+    connection.respond(request.substr(sizeof "GET /" - 1, 3) + " Status\r\nLocation: /target", "stayed");
+  });
+  for (const int status : {300, 301, 302, 303, 305, 306, 307, 308, 309}) {
+    const bool isRedirect = status == 301 || status == 302 || status == 303 || status == 307 || status == 308;
+    const auto response = fetch(server.url("/" + std::to_string(status)));
+    expectKind(WebErrorKind::none, response);
+    EXPECT_EQ(textOf(*response), isRedirect ? "arrived" : "stayed") << status;
+    EXPECT_EQ(response->statusCode, isRedirect ? 200 : status);
+  }
+}
+
 TEST_F(CurlWebClientTest, ARedirectToHttpIsRefusedAndNobodyIsAsked) {
   HttpsServer plain([](Connection& connection) { connection.respond("200 OK", "plain"); },
                     HttpsServer::Wire::plain);
