@@ -6,6 +6,7 @@
 #include <limits>
 
 #include "platform/network/EchoMessages.h"
+#include "platform/network/ErrorNumbers.h"
 #include "platform/network/GeoMessages.h"
 #include "platform/network/GunzipMessages.h"
 #include "platform/network/WebMessages.h"
@@ -26,6 +27,12 @@ void expectNoOtherLength(const Bytes& payload, Decode decode) {
   Bytes longer = payload;
   longer.push_back(std::byte{0});
   EXPECT_FALSE(decode(longer));
+}
+
+TEST(ErrorNumbersTest, WhatTheKernelMayUseIsAnErrorNumber) {
+  for (const std::uint32_t number : {0U, 1U, 133U, 4095U}) EXPECT_TRUE(isErrorNumber(number)) << number;
+  for (const std::uint32_t number : {4096U, 0x7FFFFFFFU, 0xFFFFFFFFU})
+    EXPECT_FALSE(isErrorNumber(number)) << number;
 }
 
 TEST(WebMessagesTest, AQuestionArrivesAsItWasAsked) {

@@ -56,6 +56,16 @@ TEST(SqliteTest, EveryFunctionIsThereAndTheFirstOnesWork) {
   EXPECT_EQ(functions->column_int64(prepared, 0), 42);
 }
 
+TEST(SqliteTest, CodesThatMeanALackOfMemoryAreToldFromOthers) {
+  for (const int code : {SQLITE_NOMEM, SQLITE_NOMEM | (1 << 8), SQLITE_IOERR_NOMEM}) {
+    EXPECT_TRUE(isLackOfMemory(code)) << code;
+  }
+  for (const int code : {SQLITE_OK, SQLITE_LOCKED, SQLITE_READONLY, SQLITE_IOERR, SQLITE_IOERR_READ,
+                         SQLITE_ROW, SQLITE_DONE}) {
+    EXPECT_FALSE(isLackOfMemory(code)) << code;
+  }
+}
+
 TEST(SqliteTest, AConnectionTakesNoMorePagesThanItNeeds) {
   const TemporaryDirectory folder;
   sqlite3* opened = nullptr;
