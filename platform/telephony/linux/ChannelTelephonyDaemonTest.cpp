@@ -39,8 +39,8 @@ extern "C" int clock_gettime(clockid_t clock, timespec* time) noexcept {
 
 extern "C" int poll(pollfd* entries, nfds_t count, int time) {
   // The compiler takes what poll(2) writes for what it never reads.
-  const volatile pollfd& first = *entries;
-  if (waitingToSendFails && (first.events & POLLOUT) != 0) {
+  const pollfd* const volatile first = entries;
+  if (waitingToSendFails && (first->events & POLLOUT) != 0) {
     errno = ENOMEM;
     return -1;
   }
