@@ -17,6 +17,7 @@
 #include <chrono>
 #include <csignal>
 #include <cstring>
+#include <fstream>
 #include <functional>
 #include <memory>
 #include <set>
@@ -106,8 +107,12 @@ TEST(ClientTest, ReportsARefusedCheckInAndStaysUnconnected) {
     const Message request = script.receive(connection);
     script.send(connection, statusReply(request, 35));
   });
-  const ClientPointer client = clientFor(helper.path());
+  const ClientPointer client = clientFor(helper.directory() + "/nothing");
+  EXPECT_EQ(bvmh_connect(client.get()), BVMH_ERROR_UNREACHABLE);
+  EXPECT_EQ(bvmh_client_errno(client.get()), ENOENT);
+  ASSERT_EQ(bvmh_client_set_socket(client.get(), helper.path().c_str()), BVMH_OK);
   EXPECT_EQ(bvmh_connect(client.get()), BVMH_INVALID_SECURITY);
+  EXPECT_EQ(bvmh_client_errno(client.get()), 0) << "it is the helper's refusal, and no error of the system";
   EXPECT_EQ(BVMobileHelperClearVoicemailToken(client.get()), BVMH_ERROR_NOT_CONNECTED);
 }
 
@@ -320,6 +325,51 @@ TEST(ClientTest, TheTimeoutOfAnEarlierChannelIsSetOnANewOneToo) {
   EXPECT_EQ(BVMobileHelperClearVoicemailToken(client.get()), BVMH_ERROR_TIMED_OUT);
   bvmh_client_set_timeout(client.get(), kPlenty);
   EXPECT_EQ(BVMobileHelperResetVoicemailStore(client.get()), 33);
+}
+
+TEST(ClientTest, TheChannelGetsTheTimeoutToTheMillisecond) {
+  ScriptedHelper helper([](Script& script) {
+    const UniqueFd connection = script.accept();
+    const Message seen = script.receive(connection);
+    int ends[2];
+    ASSERT_EQ(::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, ends), 0);
+    const UniqueFd ours(ends[0]);
+    const UniqueFd theirs(ends[1]);
+    script.send(connection, checkInReply(seen), {theirs.get()});
+    const Message request = script.receive(ours);
+    timeval time{};
+    socklen_t size = sizeof time;
+    EXPECT_EQ(::getsockopt(theirs.get(), SOL_SOCKET, SO_RCVTIMEO, &time, &size), 0);
+    EXPECT_EQ(time.tv_sec, 60);
+    EXPECT_EQ(time.tv_usec, 500'000);
+    script.send(ours, statusReply(request, 0));
+  });
+  const ClientPointer client = clientFor(helper.path(), 60'500);
+  EXPECT_EQ(bvmh_connect(client.get()), BVMH_OK);
+  EXPECT_EQ(BVMobileHelperClearVoicemailToken(client.get()), BVMH_OK);
+}
+
+TEST(ClientTest, WhoWaitsForACheckInSleeps) {
+  const long thread = ::syscall(SYS_gettid);
+  bool isAsleep = false;
+  ScriptedHelper helper([&](Script& script) {
+    const UniqueFd connection = script.accept();
+    const Message request = script.receive(connection);
+    const auto end = steady_clock::now() + std::chrono::seconds(20);
+    while (!isAsleep && steady_clock::now() < end) {
+      std::ifstream file("/proc/self/task/" + std::to_string(thread) + "/stat");
+      std::string line;
+      std::getline(file, line);
+      const auto name = line.rfind(") ");
+      isAsleep = name != std::string::npos && line.substr(name + 2, 1) == "S";
+      std::this_thread::yield();
+    }
+    script.send(connection, statusReply(request, 35));
+  });
+  const ClientPointer client = clientFor(helper.path());
+  EXPECT_EQ(bvmh_connect(client.get()), BVMH_INVALID_SECURITY);
+  helper.finish();
+  EXPECT_TRUE(isAsleep);
 }
 
 TEST(ClientTest, AnAnswerToARequestThatWasAnsweredAlreadyIsALie) {

@@ -3,6 +3,7 @@
 #include "helper/mobile/CString.h"
 
 #include <gtest/gtest.h>
+#include <malloc.h>
 
 #include <array>
 #include <string>
@@ -165,6 +166,15 @@ TEST(DefaultCStringAllocatorTest, GivesAndTakesMemory) {
   ASSERT_NE(result, nullptr);
   EXPECT_STREQ(result, "/var/mobile");
   defaultCStringAllocator().deallocate(result);
+}
+
+TEST(DefaultCStringAllocatorTest, WhatIsGivenBackIsFree) {
+  constexpr std::size_t kLarge = std::size_t{64} << 20;  // more than malloc(3) ever takes from its heap
+  const auto before = ::mallinfo2().hblks;
+  void* const block = defaultCStringAllocator().allocate(kLarge);
+  ASSERT_NE(block, nullptr);
+  defaultCStringAllocator().deallocate(block);
+  EXPECT_EQ(::mallinfo2().hblks, before);
 }
 
 }  // namespace

@@ -20,6 +20,19 @@ class NoMemory final : public CStringAllocator {
   void deallocate(void*) noexcept override { ADD_FAILURE() << "nothing was allocated"; }
 };
 
+class Counting final : public CStringAllocator {
+ public:
+  void* allocate(std::size_t size) noexcept override {
+    ++live;
+    return defaultCStringAllocator().allocate(size);
+  }
+  void deallocate(void* block) noexcept override {
+    --live;
+    defaultCStringAllocator().deallocate(block);
+  }
+  int live = 0;
+};
+
 TEST(MobileUserTest, GivesHomeDirectoryAndIdsOfTheMobileAccount) {
   FakeAccountDirectory accounts;
   accounts.accounts["mobile"] = {AccountIds{501, 502}, "/var/mobile"};
@@ -85,6 +98,18 @@ TEST(MobileUserTest, WithoutMemoryForThePathThereIsNoAnswerEither) {
   MobileUser user(accounts, memory);
   EXPECT_THROW((void)user.homeDirectory(), std::bad_alloc);
   EXPECT_THROW((void)user.gid(), std::bad_alloc);
+}
+
+TEST(MobileUserTest, ThePathGoesWithTheObject) {
+  FakeAccountDirectory accounts;
+  accounts.accounts["mobile"] = {AccountIds{501, 502}, "/var/mobile"};
+  Counting memory;
+  {
+    MobileUser user(accounts, memory);
+    EXPECT_STREQ(user.homeDirectory(), "/var/mobile");
+    EXPECT_EQ(memory.live, 1);
+  }
+  EXPECT_EQ(memory.live, 0);
 }
 
 TEST(MobileUserTest, TheAccountIsLookedUpOnceAndNotBeforeItIsAskedFor) {

@@ -3,15 +3,19 @@
 #include "platform/sqlite/Sqlite.h"
 
 #include <dlfcn.h>
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <chrono>
+#include <filesystem>
 #include <fstream>
 #include <string>
 
+#include "platform/base/UniqueFd.h"
 #include "platform/files/fakes/TemporaryDirectory.h"
 #include "platform/sqlite/ForeignDatabase.h"
+#include "platform/sqlite/HeldFolder.h"
 #include "platform/sqlite/fakes/ManualSqliteTime.h"
 
 namespace brenvik {
@@ -115,6 +119,45 @@ TEST_F(ForeignDatabaseTest, AnEndlessStatementEndsWithTheTimeLimitAndOnlyIfItApp
                 "WITH RECURSIVE n(i) AS (SELECT 1 UNION ALL SELECT i + 1 FROM n LIMIT 1000) "
                 "SELECT count(*) FROM n"),
             "done");
+}
+
+TEST_F(ForeignDatabaseTest, ALockIsWaitedForUntilTheTimeIsUpAndNoLonger) {
+  const TemporaryDirectory folder;
+  const SqliteDatabase holder = open(folder / "held.db");
+  const SqliteDatabase waiting = open(folder / "held.db");
+  ASSERT_EQ(run(holder, "CREATE TABLE one(id INTEGER); BEGIN EXCLUSIVE"), "done");
+  SqliteTime limited = time.asTime();
+  int looks = 0;
+  limited.now = [&, now = limited.now] {
+    if (++looks == 10'000) (void)run(holder, "ROLLBACK");  // who waits without end gets it
+    return now();
+  };
+  SqliteTimeLimit limit(1s, limited);
+  limit.applyTo(waiting.get());
+  EXPECT_EQ(run(waiting, "BEGIN IMMEDIATE"), "database is locked");
+  EXPECT_EQ(time.slept, 1s);
+  EXPECT_LT(looks, 10'000);
+}
+
+TEST(SqliteTest, AHeldFolderIsTheBeginningOfAPathWhateverLinksThereAre) {
+  ASSERT_NE(sqlite(), nullptr);
+  const TemporaryDirectory folder;
+  folder.directory("inner");
+  (void)folder.link("inner/link.db", "file.db");
+  const UniqueFd held(::open((folder / "inner").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  std::filesystem::rename(folder / "inner", folder / "moved");
+  for (const char* const name : {"link.db", "file.db"}) {
+    sqlite3* opened = nullptr;
+    EXPECT_EQ(sqlite()->open_v2(pathInHeldFolder(held.get(), name).c_str(), &opened,
+                                SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr),
+              SQLITE_OK)
+        << name;
+    const SqliteDatabase database(opened);
+    EXPECT_EQ(sqlite()->exec(opened, "CREATE TABLE IF NOT EXISTS one(id INTEGER)", nullptr, nullptr, nullptr),
+              SQLITE_OK)
+        << name;
+  }
+  EXPECT_TRUE(std::filesystem::is_regular_file(folder / "moved/file.db"));
 }
 
 TEST_F(ForeignDatabaseTest, LooksAtTheClockAreCloseTogether) {

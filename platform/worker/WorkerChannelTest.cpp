@@ -14,6 +14,7 @@
 #include <thread>
 #include <vector>
 
+#include "platform/base/fakes/FailingAllocations.h"
 #include "platform/base/fakes/LingeringSocket.h"
 #include "platform/datagram/Datagram.h"
 #include "platform/worker/fakes/ThreadedWorker.h"
@@ -161,6 +162,30 @@ TEST_F(WorkerChannelTest, WithoutDescriptorsTheyAreALackOfThisProcess) {
   ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
   EXPECT_EQ(result, WorkerResult::outOfMemory);
   EXPECT_EQ(pair, WorkerResult::outOfMemory);
+}
+
+TEST_F(WorkerChannelTest, WithoutMemoryForAllOfItNothingOfAMessageIsThere) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "ThreadSanitizer needs its own operator new";
+  WorkerMessage sent;
+  sent.payload = bytesOf("payload");
+  sent.descriptors.emplace_back(::dup(STDERR_FILENO));
+  WorkerResult result = WorkerResult::outOfMemory;
+  int lacks = 0;
+  while (lacks < 10 && result == WorkerResult::outOfMemory) {
+    ASSERT_EQ(one.send(sent), WorkerResult::done);
+    message = {};
+    {
+      const FailingAllocations failing(lacks);
+      result = receiveNow(other);
+    }
+    if (result != WorkerResult::outOfMemory) break;
+    EXPECT_TRUE(message.payload.empty()) << lacks;
+    EXPECT_TRUE(message.descriptors.empty()) << lacks;
+    ++lacks;
+  }
+  EXPECT_EQ(result, WorkerResult::done);
+  EXPECT_EQ(lacks, 2) << "for the payload, and for the descriptors";
+  EXPECT_EQ(message.payload, sent.payload);
 }
 
 // What a hostile peer sends: each leaves the descriptor to be closed by the receiver in another way.

@@ -2,14 +2,17 @@
 // SPDX-FileCopyrightText: The BrenvikMobileHelper authors
 #include "platform/contacts/linux/SqliteContacts.h"
 
+#include <dlfcn.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/inotify.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <array>
+#include <cerrno>
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
@@ -20,9 +23,17 @@
 #include <vector>
 
 #include "platform/base/UniqueFd.h"
+#include "platform/base/fakes/FailingAllocations.h"
+#include "platform/base/fakes/FailingCalls.h"
 #include "platform/contacts/fakes/InMemoryContacts.h"
 #include "platform/sqlite/Sqlite.h"
 #include "platform/sqlite/fakes/ManualSqliteTime.h"
+
+extern "C" void* dlopen(const char* file, int mode) {
+  if (brenvik::FailingCall::failsNow("dlopen")) return nullptr;
+  static const auto real = reinterpret_cast<void* (*)(const char*, int)>(::dlsym(RTLD_NEXT, "dlopen"));
+  return real(file, mode);
+}
 
 namespace brenvik {
 namespace {
@@ -520,6 +531,55 @@ TYPED_TEST(ContactsContractTest, ATextThatIsNotUtf8IsAFailureThatChangesNothing)
 TYPED_TEST(ContactsContractTest, UnreachableContactsGiveNoManager) {
   this->contract.makeUnreachable();
   EXPECT_EQ(this->contract.service().makeChannelManager(), nullptr);
+}
+
+TEST_F(SqliteContactsTest, ARemapThatLacksMemoryFailsWithoutADescription) {
+  if (!FailingAllocations::kWork) GTEST_SKIP() << "ThreadSanitizer needs its own operator new";
+  makeDatabase();
+  const auto manager = contacts().makeChannelManager();
+  ASSERT_NE(manager, nullptr);
+  std::optional<std::string> error;
+  bool done = true;
+  {
+    const FailingAllocations failing(0);
+    done = manager->remapChannelIdentifier("old", "\xFF", &error);
+  }
+  EXPECT_FALSE(done);
+  EXPECT_EQ(error, std::nullopt);
+}
+
+TEST_F(SqliteContactsTest, TheFolderMayHaveTheNumberOfStandardInput) {
+  makeDatabase();
+  const UniqueFd before(::fcntl(STDIN_FILENO, F_DUPFD_CLOEXEC, STDERR_FILENO + 1));
+  ASSERT_EQ(::dup2(folder.get(), STDIN_FILENO), STDIN_FILENO);
+  const auto manager = SqliteContacts([] { return STDIN_FILENO; }).makeChannelManager();
+  if (before.isValid())
+    EXPECT_EQ(::dup2(before.get(), STDIN_FILENO), STDIN_FILENO);
+  else
+    ::close(STDIN_FILENO);
+  EXPECT_NE(manager, nullptr);
+}
+
+TEST_F(SqliteContactsTest, WhatIsNoPlainFileIsNotEvenOpened) {
+  ASSERT_EQ(::mkfifo(database().c_str(), 0600), 0);
+  const UniqueFd watch(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+  ASSERT_GE(::inotify_add_watch(watch.get(), database().c_str(), IN_OPEN), 0);
+  EXPECT_EQ(remap(), "no manager");
+  std::array<char, 512> event;
+  EXPECT_EQ(::read(watch.get(), event.data(), event.size()), -1) << "somebody opened it";
+  EXPECT_EQ(errno, EAGAIN);
+}
+
+TEST_F(SqliteContactsTest, WithoutTheLibraryThereIsNoManager) {
+  std::ofstream(database()) << "a plain file";
+  testing::FLAGS_gtest_death_test_style = "threadsafe";  // a process of its own, which has not loaded it yet
+  EXPECT_EXIT(
+      {
+        const FailingCall missing("dlopen", ENOENT, 0, FailingCall::HowOften::always);
+        const bool isThere = contacts().makeChannelManager() != nullptr;
+        ::_exit(missing.failures() == 1 && !isThere ? 7 : 1);
+      },
+      testing::ExitedWithCode(7), "");
 }
 
 }  // namespace

@@ -816,5 +816,31 @@ TEST_F(ProcessExitTest, CancelRunsItsHandlerOnceAndTheExitIsNotTold) {
   source.reset();
 }
 
+TEST_F(ProcessExitTest, ASourceThatOutlivesItsLoopKeepsNothingOpen) {
+  const auto watched = [] {
+    int count = 0;
+    for (const auto& each : std::filesystem::directory_iterator("/proc/self/fd")) {
+      std::error_code gone;
+      if (std::filesystem::read_symlink(each.path(), gone).string().find("pidfd") != std::string::npos)
+        ++count;
+    }
+    return count;
+  };
+  const int before = watched();
+  auto queues = std::make_unique<SystemQueues>(*loop);
+  auto [pid, life] = child();
+  auto source = queues->makeProcessExitSource(pid, processStartTime(pid).value(), [] {}, {});
+  ASSERT_NE(source, nullptr);
+  source->activate();
+  ASSERT_EQ(loop->run(0s, ReturnAfterSource::no), RunResult::timedOut);
+  EXPECT_EQ(watched(), before + 1);
+  queues.reset();
+  loop.reset();
+  source.reset();
+  EXPECT_EQ(watched(), before);
+  life.reset();
+  ::waitpid(pid, nullptr, 0);
+}
+
 }  // namespace
 }  // namespace brenvik

@@ -4,6 +4,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -77,6 +78,23 @@ TEST_F(PreparedFolderTest, WithoutAHomeThereIsNoFolder) {
   EXPECT_EQ(open(folderOf(""), IfMissing::create), State::missing);
   EXPECT_EQ(open(folderOf(home / "missing"), IfMissing::create), State::missing);
   EXPECT_FALSE(isThere(home / "missing"));
+}
+
+TEST_F(PreparedFolderTest, WithTooFewDescriptorsItIsALackWhateverWasToBeMade) {
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+  const UniqueFd next(::dup(STDERR_FILENO));
+  int lacks = 0;
+  State state = State::outOfMemory;
+  for (rlim_t count = 0; count < 20 && state == State::outOfMemory; ++count) {
+    const rlimit few{static_cast<rlim_t>(next.get()) + 1 + count, before.rlim_max};
+    ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &few), 0);
+    state = open(folderOf(home.path()), IfMissing::create);
+    ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
+    if (state == State::outOfMemory) ++lacks;
+  }
+  EXPECT_EQ(state, State::open);
+  EXPECT_GT(lacks, 2) << "for the home, for a folder in it, for making it";
 }
 
 TEST_F(PreparedFolderTest, AHomeBehindALinkOfRootsIsTheSameHome) {

@@ -3,8 +3,10 @@
 #include "platform/telephony/linux/ChannelTelephonyDaemon.h"
 
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -13,6 +15,7 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <filesystem>
 #include <thread>
 
@@ -20,6 +23,29 @@
 #include "platform/base/UniqueFd.h"
 #include "platform/datagram/Datagram.h"
 #include "platform/plist/PropertyListCodec.h"
+
+namespace {
+constinit thread_local bool clockStands = false;
+constinit thread_local bool waitingToSendFails = false;
+}  // namespace
+
+extern "C" int clock_gettime(clockid_t clock, timespec* time) noexcept {
+  if (clockStands) {
+    *time = {1000, 0};
+    return 0;
+  }
+  return static_cast<int>(::syscall(SYS_clock_gettime, clock, time));
+}
+
+extern "C" int poll(pollfd* entries, nfds_t count, int time) {
+  // The compiler takes what poll(2) writes for what it never reads.
+  const pollfd* const volatile first = entries;
+  if (waitingToSendFails && (first->events & POLLOUT) != 0) {
+    errno = ENOMEM;
+    return -1;
+  }
+  return static_cast<int>(::syscall(SYS_poll, entries, count, time));
+}
 
 namespace brenvik {
 namespace {
@@ -297,6 +323,41 @@ TEST_F(ChannelTelephonyDaemonTest, ADaemonThatDoesNotAnswerCostsNoMoreThanThePat
   EXPECT_EQ(pushAddress([&](UniqueFd channel) { kept = std::move(channel); }, 50ms),
             telephonyResult(kPosixErrorDomain, ETIMEDOUT));
   EXPECT_GE(Clock::now() - before, 50ms);
+}
+
+TEST_F(ChannelTelephonyDaemonTest, APushThatCouldNotBeSentHasNoAnswerWhateverTheDaemonSays) {
+  constexpr int kAnswers = 64;
+  service.listen();
+  ChannelTelephonyDaemon daemon(service.directory, 60s);
+  UniqueFd channel;
+  std::thread brenvik([&] {
+    channel = service.accept();
+    // All answers at once, and nothing is read any more.
+    const TelephonyPushReply reply = replyTo(receive(channel));
+    for (int i = 0; i < kAnswers; ++i) sendReply(channel, reply);
+  });
+  const auto connection = daemon.create({});
+  int pushes = 0;
+  TelephonyResult result = 0;
+  if (connection != nullptr) {
+    waitingToSendFails = true;
+    for (; result == 0 && pushes < kAnswers; ++pushes)
+      result = connection->setLocalRoutableAddress(std::string(60'000, 'x'));
+  }
+  waitingToSendFails = false;
+  brenvik.join();
+  ASSERT_NE(connection, nullptr);
+  EXPECT_EQ(result, telephonyResult(kPosixErrorDomain, ENOMEM));
+  EXPECT_LT(pushes, kAnswers);
+}
+
+TEST_F(ChannelTelephonyDaemonTest, WithNoTimeLeftNobodyIsConnectedTo) {
+  service.listen();
+  ChannelTelephonyDaemon daemon(service.directory, 0s);
+  clockStands = true;
+  const auto connection = daemon.create({});
+  clockStands = false;
+  EXPECT_EQ(connection, nullptr);
 }
 
 TEST_F(ChannelTelephonyDaemonTest, ADaemonThatTalksWithoutEndIsCutOffAllTheSame) {

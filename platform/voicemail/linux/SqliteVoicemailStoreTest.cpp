@@ -350,6 +350,18 @@ TEST_F(SqliteVoicemailStoreTest, AFolderThatCannotBeHeldFastIsNoPlaceForATokenAn
   EXPECT_EQ(store.copyToken(), token);
 }
 
+TEST_F(SqliteVoicemailStoreTest, TablesThatAreTakenFromAnOpenStoreAreMadeAgain) {
+  store.setToken(&token);
+  plant("DROP TABLE general");
+  RecordingLog log;
+  const std::string other = "other";
+  store.setToken(&other);
+  EXPECT_EQ(store.copyToken(), other);
+  plant("DROP TABLE general");
+  EXPECT_EQ(store.copyToken(), std::nullopt);
+  EXPECT_TRUE(log.entries().empty());
+}
+
 TEST_F(SqliteVoicemailStoreTest, AnEndlessSearchIsCutOffAndTold) {
   store.setToken(&token);
   plant(
