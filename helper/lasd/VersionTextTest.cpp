@@ -52,9 +52,10 @@ TEST(VersionTextTest, VersionsCompareByTheTable) {
       {"a1", "a", false},
       {"\xC3\x89t\xC3\xA9", "\xC3\xA9T\xC3\x89", true},  // E and e with acute accent
       {"\xC3\xA9", "e", false},
-      {"\xD0\x96", "\xD0\xB6", true},  // Cyrillic zhe
-      {"\xCE\xA3", "\xCF\x83", true},  // Greek sigma
-      {"\xEF\xBC\x91", "1", false},    // a full-width one is no ASCII digit
+      {"\xD0\x96", "\xD0\xB6", true},          // Cyrillic zhe
+      {"\xCE\xA3", "\xCF\x83", true},          // Greek sigma
+      {"\xEF\xBC\x91", "1", false},            // a full-width one is no ASCII digit
+      {"\xEF\xBC\xA1", "\xEF\xBD\x81", true},  // a full-width A
       {"\xF0\x9D\x9F\x8F", "1", false},
       {"AZ", "az", true},
       {"@[`{", "`{@[", false},                         // beside the letters
