@@ -776,6 +776,20 @@ TEST_F(LeftoversTest, WhatAStrangerMadeUnderSuchANameIsNeverRemoved) {
 
 // ---- moves
 
+TEST_F(LinuxFileManagerTest, WhatIsNoDirectoryIsInTheWayOfOneAndADirectoryIsNot) {
+  const auto make = [&](const std::string& path) {
+    return files.createDirectory(path, {}, Intermediates::create);
+  };
+  const std::string file = dir.file("file", "kept");
+  EXPECT_EQ(make(file), failure(EEXIST));
+  EXPECT_EQ(make(file + "/below"), failure(ENOTDIR));
+  EXPECT_EQ(make(dir.link("link", "file")), failure(EEXIST));
+  EXPECT_EQ(make(dir.directory("directory")), kSuccess);
+  EXPECT_EQ(make(dir.link("way", "directory")), kSuccess);
+  EXPECT_EQ(make(dir / "new/below"), kSuccess);
+  EXPECT_EQ(contentOf(file), "kept");
+}
+
 TEST_F(LinuxFileManagerTest, AMoveInsideOneFileSystemKeepsTheInode) {
   dir.file("tree/file", "x");
   const ino_t before = statOf(dir / "tree").st_ino;
