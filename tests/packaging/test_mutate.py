@@ -100,6 +100,8 @@ class Mistakes(unittest.TestCase):
                 "int a = 0;": ["int a = 1;"],
                 "int f() { return g(); }": ["int f() { return {}; }"],
                 "int f() { g(a, b.c); }": ["int f() { ; }", "int f() { g(b.c, a); }"],
+                "int f() { std::swap(a, b.c); }": ["int f() { ; }"],
+                "int f() { return kern::success; }": [],
                 "int f() { a.b = c; }": ["int f() { ; }"],
                 "void f() noexcept { ++a; }": ["void f() noexcept { return; ++a; }"],
                 "int f() { if (a) ++b; }": ["int f() { if (!(a)) ++b; }"],
@@ -139,9 +141,12 @@ class Mistakes(unittest.TestCase):
         self.assertIn("nothing", done.stderr)
 
     def test_what_cannot_be_done_is_told(self):
+        self.write("platform/b/B.cpp", "int b = 0;\n")
         for arguments, text in {
                 ("platform/c",): "mutate: platform/c: no source of the project\n",
                 ("platform/a/ATest.cpp",): "mutate: platform/a/ATest.cpp: tests, fakes, examples and main.cpp are left alone\n",
+                ("platform/b",): "platform/b/B.cpp: left out: no folder above or below it has unit tests\n"
+                                 "mutate: no unit tests for any of them\n",
                 ("--count", "0", "."): "above zero\n",
                 (): "name files or folders, or --changed; see --help\n",
         }.items():
@@ -172,6 +177,8 @@ class Mistakes(unittest.TestCase):
         self.assertEqual((busy.returncode, busy.stderr), (2, "mutate: another run works in build/mutate\n"))
 
         # A second look builds nothing.
+        quick = self.mutate("--quick", "platform/a")
+        self.assertEqual((quick.returncode, quick.stdout), (1, done.stdout))
         again = self.mutate("platform/a")
         self.assertEqual((again.returncode, again.stdout), (1, done.stdout))
         self.assertNotIn("building", again.stderr)
